@@ -1,0 +1,41 @@
+#pragma once
+
+#include "foundation/Value.h"
+
+#include <memory>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace rolvane {
+
+// Preferences: a row per domain and key in one SQLite file (synchronous=FULL). Writes and removals are kept in memory,
+// visible to this process's reads at once, until `synchronize` writes them in one transaction; reads of keys that have
+// no unwritten change see what other processes have synchronised. Values are BinaryValue blobs. Any thread.
+// A damaged file throws kCXPreferencesException that names the file and says how to go on; it is never overwritten.
+class Preferences {
+public:
+    explicit Preferences(std::string path); // the file is made on the first write, mode 0600, directories 0700
+    ~Preferences();
+    Preferences(const Preferences&) = delete;
+    Preferences& operator=(const Preferences&) = delete;
+
+    Value get(std::string_view domain, std::string_view key) const; // absent when there is none
+    void set(std::string_view domain, std::string_view key, Value value); // an absent value removes
+    void remove(std::string_view domain, std::string_view key);
+    void synchronize(std::string_view domain);
+    std::vector<std::string> keys(std::string_view domain) const;
+    std::vector<std::string> domains() const;
+    const std::string& path() const;
+
+    static Preferences& shared(); // $XDG_STATE_HOME/rolvane/preferences.db
+
+private:
+    struct Impl;
+    std::unique_ptr<Impl> _impl;
+};
+
+inline constexpr const char* kDaemonDomain = "net.rolvane.RolvaneManager";
+inline constexpr const char* kApplicationDomain = "net.rolvane.Rolvane"; // the contact application's
+
+} // namespace rolvane

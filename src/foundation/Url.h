@@ -1,0 +1,45 @@
+#pragma once
+
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace rolvane {
+
+// A URL (RFC 3986), immutable, kept as the text it was parsed from: `absoluteString` gives that text back.
+// Equality is of the text.
+class Url {
+public:
+    Url() = default;                                       // the empty URL
+    static std::optional<Url> parse(std::string_view text); // nothing when there is no scheme, or on malformed text
+    explicit Url(std::string_view text);                   // as parse; throws kCXInvalidArgumentException instead
+    static Url fileURL(std::string_view path);             // "file:" + the percent-encoded absolute path
+
+    const std::string& absoluteString() const { return _text; }
+    std::string scheme() const;      // as written
+    std::string host() const;        // without brackets and user information, "" when there is none
+    std::optional<int> port() const;
+    std::string origin() const;      // scheme://host:port in lower case with the scheme's default port made explicit
+    std::string encodedPath() const; // as written, "" when there is none
+    std::string path() const;        // percent-decoded
+    // Decoded path components; the first one is the root "/" when the path is absolute. Empty segments are dropped.
+    std::vector<std::string> pathComponents() const;
+
+    std::string cxLastComponent() const; // decoded; "" for the root or an empty path
+    // Appends one component, percent-encoded (a '/' inside it becomes %2F). No trailing slash is written.
+    Url cxURLByAppendingComponent(std::string_view component) const;
+    Url cxURLByDeletingLastComponent() const; // no trailing slash but for the root
+    Url withScheme(std::string_view scheme) const;
+
+    friend bool operator==(const Url&, const Url&) = default;
+    friend const std::string& description(const Url& u) { return u._text; }
+
+    static std::string percentDecode(std::string_view text);          // malformed escapes stay as they are
+    static std::string percentEncodeComponent(std::string_view text); // all but unreserved characters
+
+private:
+    std::string _text;
+};
+
+} // namespace rolvane
