@@ -77,8 +77,8 @@ std::string Date::toISO8601() const {
 
 std::string Date::toISO8601Precise() const {
     const Civil c = civil(_seconds);
-    return fmt::format("{:04}-{:02}-{:02}T{:02}:{:02}:{:02}.{:06}Z", c.year, c.month, c.day, c.hour, c.minute,
-                       c.second, static_cast<int>(c.fraction * 1e6));
+    return fmt::format("{:04}-{:02}-{:02}T{:02}:{:02}:{:02}.{:06}Z", c.year, c.month, c.day, c.hour, c.minute, c.second,
+                       static_cast<int>(c.fraction * 1e6));
 }
 
 std::string Date::toHTTP() const {
@@ -124,10 +124,12 @@ std::optional<Date> Date::fromHTTP(std::string_view text) {
         used == length) {
         // IMF-fixdate
     } else if (used = 0, std::sscanf(s.c_str(), "%*[A-Za-z], %2d-%3s-%2d %2d:%2d:%2d GMT%n", &d, month, &y, &h, &mi,
-                                     &sec, &used) == 6 && used == length) {
+                                     &sec, &used) == 6 &&
+                             used == length) {
         y += y < 70 ? 2000 : 1900; // RFC 850 form
-    } else if (used = 0, std::sscanf(s.c_str(), "%*3s %3s %2d %2d:%2d:%2d %4d%n", month, &d, &h, &mi, &sec, &y,
-                                     &used) == 6 && used == length) {
+    } else if (used = 0,
+               std::sscanf(s.c_str(), "%*3s %3s %2d %2d:%2d:%2d %4d%n", month, &d, &h, &mi, &sec, &y, &used) == 6 &&
+                   used == length) {
         // asctime form
     } else {
         return std::nullopt;

@@ -34,9 +34,13 @@ struct LogArgument {
 };
 
 template <class T>
-concept HasDescriptionMember = requires(const T& t) { { t.description() } -> std::convertible_to<std::string>; };
+concept HasDescriptionMember = requires(const T& t) {
+    { t.description() } -> std::convertible_to<std::string>;
+};
 template <class T>
-concept HasDescriptionFunction = requires(const T& t) { { description(t) } -> std::convertible_to<std::string>; };
+concept HasDescriptionFunction = requires(const T& t) {
+    { description(t) } -> std::convertible_to<std::string>;
+};
 
 template <class T>
 LogArgument logArgument(const T& value);
@@ -57,7 +61,10 @@ std::string describeObject(const T& value) {
         return value.description();
     else if constexpr (HasDescriptionFunction<T>)
         return description(value);
-    else if constexpr (requires { *value; static_cast<bool>(value); }) // pointers, optionals
+    else if constexpr (requires {
+                           *value;
+                           static_cast<bool>(value);
+                       }) // pointers, optionals
         return value ? describeObject(*value) : "(null)";
     else
         return describeRange(value);

@@ -20,7 +20,7 @@ public:
     Preferences(const Preferences&) = delete;
     Preferences& operator=(const Preferences&) = delete;
 
-    Value get(std::string_view domain, std::string_view key) const; // absent when there is none
+    Value get(std::string_view domain, std::string_view key) const;       // absent when there is none
     void set(std::string_view domain, std::string_view key, Value value); // an absent value removes
     void remove(std::string_view domain, std::string_view key);
     void synchronize(std::string_view domain);

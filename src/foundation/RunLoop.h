@@ -36,11 +36,12 @@ public:
     // A file descriptor that is watched for reading (EPOLLIN) or what `events` says. The descriptor stays the caller's.
     [[nodiscard]] Handle addPort(int fd, std::function<void(uint32_t events)> ready, uint32_t events = 0x001);
 
-    void runUntil(Date limit);        // serves until the limit or until `stop`
-    void runOnce(double limitSeconds); // serves what is ready, waiting at most so long for the first event; one turn at least
-    void stop();                      // ends the innermost runUntil after the current handler
-    void wake();                      // any thread: makes a waiting loop turn once
-    sd_event* event() const;          // for sd-bus; borrowed
+    void runUntil(Date limit); // serves until the limit or until `stop`
+    void runOnce(
+        double limitSeconds); // serves what is ready, waiting at most so long for the first event; one turn at least
+    void stop();              // ends the innermost runUntil after the current handler
+    void wake();              // any thread: makes a waiting loop turn once
+    sd_event* event() const;  // for sd-bus; borrowed
 
 private:
     struct Impl;

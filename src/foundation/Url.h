@@ -11,14 +11,14 @@ namespace rolvane {
 // Equality is of the text.
 class Url {
 public:
-    Url() = default;                                       // the empty URL
+    Url() = default;                                        // the empty URL
     static std::optional<Url> parse(std::string_view text); // nothing when there is no scheme, or on malformed text
-    explicit Url(std::string_view text);                   // as parse; throws kCXInvalidArgumentException instead
-    static Url fileURL(std::string_view path);             // "file:" + the percent-encoded absolute path
+    explicit Url(std::string_view text);                    // as parse; throws kCXInvalidArgumentException instead
+    static Url fileURL(std::string_view path);              // "file:" + the percent-encoded absolute path
 
     const std::string& absoluteString() const { return _text; }
-    std::string scheme() const;      // as written
-    std::string host() const;        // without brackets and user information, "" when there is none
+    std::string scheme() const; // as written
+    std::string host() const;   // without brackets and user information, "" when there is none
     std::optional<int> port() const;
     std::string origin() const;      // scheme://host:port in lower case with the scheme's default port made explicit
     std::string encodedPath() const; // as written, "" when there is none

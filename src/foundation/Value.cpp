@@ -48,13 +48,25 @@ struct Array::Storage {
 };
 
 Array::Array() : _p(std::make_shared<Storage>()) {}
-Array::Array(std::initializer_list<Value> values) : Array() { _p->items.assign(values); }
-Array::Array(std::vector<Value> values) : Array() { _p->items = std::move(values); }
+Array::Array(std::initializer_list<Value> values) : Array() {
+    _p->items.assign(values);
+}
+Array::Array(std::vector<Value> values) : Array() {
+    _p->items = std::move(values);
+}
 
-size_t Array::count() const { return _p->items.size(); }
-std::vector<Value>::const_iterator Array::begin() const { return _p->items.begin(); }
-std::vector<Value>::const_iterator Array::end() const { return _p->items.end(); }
-void Array::reserve(size_t n) { _p->items.reserve(n); }
+size_t Array::count() const {
+    return _p->items.size();
+}
+std::vector<Value>::const_iterator Array::begin() const {
+    return _p->items.begin();
+}
+std::vector<Value>::const_iterator Array::end() const {
+    return _p->items.end();
+}
+void Array::reserve(size_t n) {
+    _p->items.reserve(n);
+}
 
 const Value& Array::operator[](size_t i) const {
     if (i >= _p->items.size())
@@ -75,7 +87,8 @@ void Array::appendAll(const Array& other) {
 
 void Array::insert(size_t index, Value v) {
     if (index > count())
-        throw CXException(kCXRangeException, fmt::format("index {} is beyond the end of an array of {}", index, count()));
+        throw CXException(kCXRangeException,
+                          fmt::format("index {} is beyond the end of an array of {}", index, count()));
     _p->added(v);
     _p->items.insert(_p->items.begin() + static_cast<std::ptrdiff_t>(index), std::move(v));
 }
@@ -126,26 +139,40 @@ std::optional<size_t> Array::indexOf(const Value& v) const {
     return static_cast<size_t>(it - begin());
 }
 
-Array Array::mutableCopy() const { return Array(_p->items); }
+Array Array::mutableCopy() const {
+    return Array(_p->items);
+}
 
-bool operator==(const Array& a, const Array& b) { return a._p == b._p || a._p->items == b._p->items; }
+bool operator==(const Array& a, const Array& b) {
+    return a._p == b._p || a._p->items == b._p->items;
+}
 
 Dictionary::Dictionary() : _p(std::make_shared<Map>()) {}
 Dictionary::Dictionary(std::initializer_list<DictionaryEntry> entries) : Dictionary() {
     for (const auto& [key, value] : entries) set(key, value);
 }
 
-bool Dictionary::isSame(const Dictionary& other) const { return _p == other._p; }
-size_t Dictionary::count() const { return _p->size(); }
-Dictionary::const_iterator Dictionary::begin() const { return _p->begin(); }
-Dictionary::const_iterator Dictionary::end() const { return _p->end(); }
+bool Dictionary::isSame(const Dictionary& other) const {
+    return _p == other._p;
+}
+size_t Dictionary::count() const {
+    return _p->size();
+}
+Dictionary::const_iterator Dictionary::begin() const {
+    return _p->begin();
+}
+Dictionary::const_iterator Dictionary::end() const {
+    return _p->end();
+}
 
 const Value& Dictionary::operator[](std::string_view key) const {
     const auto it = _p->find(key);
     return it == _p->end() ? kAbsent : it->second;
 }
 
-bool Dictionary::contains(std::string_view key) const { return _p->find(key) != _p->end(); }
+bool Dictionary::contains(std::string_view key) const {
+    return _p->find(key) != _p->end();
+}
 
 void Dictionary::set(std::string_view key, Value v) {
     if (v.isAbsent())
@@ -193,7 +220,9 @@ Dictionary Dictionary::mutableCopy() const {
     return copy;
 }
 
-bool operator==(const Dictionary& a, const Dictionary& b) { return a._p == b._p || *a._p == *b._p; }
+bool operator==(const Dictionary& a, const Dictionary& b) {
+    return a._p == b._p || *a._p == *b._p;
+}
 
 bool Value::boolean(bool otherwise) const {
     if (const auto* b = std::get_if<bool>(&_v)) return *b;

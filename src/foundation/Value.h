@@ -42,8 +42,8 @@ public:
     void insert(size_t index, Value v);
     void replace(size_t index, Value v);
     void removeAt(size_t index);
-    void removeAll(const Value& v);            // every occurrence
-    void removeAllOf(const Array& others);     // every occurrence of every element, one walk
+    void removeAll(const Value& v);        // every occurrence
+    void removeAllOf(const Array& others); // every occurrence of every element, one walk
     void reserve(size_t n);
 
     bool contains(const Value& v) const;
@@ -85,8 +85,8 @@ public:
     Dictionary dictionaryFor(std::string_view key);
     Array arrayFor(std::string_view key);
 
-    Dictionary mutableCopy() const; // shallow
-    bool isSame(const Dictionary& other) const; // identity
+    Dictionary mutableCopy() const;                                   // shallow
+    bool isSame(const Dictionary& other) const;                       // identity
     friend bool operator==(const Dictionary& a, const Dictionary& b); // by content
 
 private:
@@ -131,15 +131,15 @@ public:
     bool isNumber() const { return type() == ValueType::integer || type() == ValueType::real; }
 
     // Tolerant readers: the given fallback when the value is of another kind. Nothing throws.
-    bool boolean(bool otherwise = false) const;           // numbers: not zero
-    int64_t integer(int64_t otherwise = 0) const;         // reals are truncated, numeric strings are read
+    bool boolean(bool otherwise = false) const;   // numbers: not zero
+    int64_t integer(int64_t otherwise = 0) const; // reals are truncated, numeric strings are read
     double real(double otherwise = 0) const;
-    const std::string& string() const;                    // "" when not a string
+    const std::string& string() const; // "" when not a string
     std::optional<std::string> optionalString() const;
     std::optional<Date> date() const;
-    const Bytes& data() const;                            // empty when not data
-    Array array() const;                                  // a new empty array when not an array
-    Dictionary dictionary() const;                        // a new empty dictionary when not a dictionary
+    const Bytes& data() const;     // empty when not data
+    Array array() const;           // a new empty array when not an array
+    Dictionary dictionary() const; // a new empty dictionary when not a dictionary
     const Array* arrayIf() const { return std::get_if<Array>(&_v); }
     const Dictionary* dictionaryIf() const { return std::get_if<Dictionary>(&_v); }
     const std::string* stringIf() const;
@@ -163,9 +163,15 @@ struct DictionaryEntry {
     Value value;
 };
 
-inline std::string description(const Value& v) { return v.description(); }
-inline std::string description(const Array& a) { return Value(a).description(); }
-inline std::string description(const Dictionary& d) { return Value(d).description(); }
+inline std::string description(const Value& v) {
+    return v.description();
+}
+inline std::string description(const Array& a) {
+    return Value(a).description();
+}
+inline std::string description(const Dictionary& d) {
+    return Value(d).description();
+}
 
 // Union of two string arrays: all of a in its order, then those of b that a lacks, in b's order.
 Array cxArrayCombinedWithArray(const Array& a, const Array& b);

@@ -1,0 +1,42 @@
+#pragma once
+
+#include "acl/CXACLManager.h"
+#include "foundation/Value.h"
+#include "model/CXDChangeRecord.h"
+
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace rolvane {
+
+class CXDConduit;
+
+// What a conduit asks of the engine that owns it. CXDSyncEngine implements it; tests implement it small.
+class ConduitEngine : public LocationOwner {
+public:
+    // The mutable dictionary under the key inside the conduit's data, made empty at either level when absent.
+    virtual Dictionary conduitObjectForKey(const std::string& conduitID, const std::string& key) = 0;
+    virtual void setConduitObjectForKey(const std::string& conduitID, const Value& object, const std::string& key) = 0;
+    virtual void syncPrefs() = 0;
+
+    virtual bool isRevoked(const RemoteLocation& location) const = 0;
+    virtual std::vector<RemoteLocation> revokedRemoteLocations() const = 0;
+    virtual void revokeRemoteLocation(const RemoteLocation& location, const std::optional<UniqueId>& subscription) = 0;
+    virtual void setRemoteLocationForSubscriptionUID(const std::optional<RemoteLocation>& location,
+                                                     const std::optional<UniqueId>& subscription) = 0;
+    virtual std::optional<RemoteLocation> remoteLocationForSubscriptionUID(const UniqueId& subscription) const = 0;
+
+    virtual bool shouldChangeRecordBeCanceled(const CXDChangeRecord& record) const = 0; // any thread
+    virtual bool lockURL(const Url& url) = 0;                                           // any thread
+    virtual int32_t sourcesForGUID(const UniqueId& group) = 0;
+    virtual CXDConduit* conduitForSyncSource(int32_t source) = 0; // none when no conduit serves it
+
+    virtual void updateStateAndExitIfNeeded() = 0;
+    virtual void checkCXShareCount() = 0;
+    virtual void applyChangeRecords(const CXDChangeRecords& records) = 0; // a trickle pass
+    virtual void bringSourcesUpToDate() = 0;
+    virtual void cancel() = 0; // stops progress and ends the process
+};
+
+} // namespace rolvane
