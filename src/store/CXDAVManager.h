@@ -1,0 +1,105 @@
+#pragma once
+
+#include "foundation/Date.h"
+#include "foundation/Notification.h"
+#include "foundation/StrongString.h"
+#include "foundation/Url.h"
+#include "foundation/Value.h"
+#include "store/Account.h"
+#include "store/CXFileManager.h"
+#include "store/HttpTransport.h"
+
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace rolvane {
+
+// Why the store cannot be used. `code` 0: no error was produced.
+struct CXDAVError {
+    int code = 0;
+    std::string reason; // a sentence for a person
+};
+inline constexpr int kCXDAVErrorTimedOut = -1001;
+inline constexpr int kCXDAVErrorCannotConnect = -1004;
+inline constexpr int kCXDAVErrorBadServerResponse = -1011; // whoever answered is not a WebDAV server
+inline constexpr int kCXDAVErrorAuthentication = -1012;    // the account's user name or password was refused
+inline constexpr int kCXDAVErrorSecureConnection = -1200;
+inline constexpr int kCXDAVErrorNoAccount = -1100; // no account, or one that cannot be used
+
+// The client of one account's network store. URLs given to it are names (remote locations and what lies below them);
+// it knows where the bytes are. Any thread; operations wait for the server, at most the transport's deadlines.
+//
+// Result codes are the server's own HTTP status; 0 when no answer came or the answer cannot be believed (whoever
+// answered is not a WebDAV server: a captive portal or a proxy). 403 and 404 come only from a server that answered
+// OPTIONS with "DAV: 1". A 207 to PUT, DELETE or MKCOL is a failure.
+//
+// Conditional writes: when a thread reads the dictionary at a URL and its next operation on a dictionary is a write to
+// the same URL, the write goes through only if the file is still the one that was read (or still absent); otherwise
+// it fails with 412.
+//
+// A URL may be a group's state file and its directory at once: the dictionary of a collection lies inside it under
+// kStateName, and a file in the way of a collection is moved there when the collection is made. Listings show one
+// entry.
+class CXDAVManager : public CXFileManager {
+public:
+    static constexpr const char* kStateName = ".state"; // never a group's, person's or structure file's name
+
+    // Credentials are fetched from the account's password source on first need.
+    explicit CXDAVManager(CXDAVAccount account);                        // over a CurlTransport of its own
+    CXDAVManager(CXDAVAccount account, std::shared_ptr<HttpTransport>); // over the given transport, which signs in
+    ~CXDAVManager() override;
+
+    // -- the process's own client, built from the saved account on first use; never null. Without an account (or with
+    // one that cannot be used) user, password and address are empty and every operation fails.
+    static CXDAVManager& defaultManager();
+    static void setDefaultManager(std::shared_ptr<CXDAVManager> manager); // tests; null: build anew on next use
+    static std::string vaultraUser();
+    static std::string password();        // "" when it cannot be had; the failed-password handler is then called
+    static std::string ostrelUserAgent(); // "Rolvane/<version>"
+    static std::string vaultraAddress();  // the endpoint's host
+    static bool canReachOstrelError(CXDAVError& error);
+    static Url ostrelBaseLocationForOstrelUser(const UserName& user);
+    static void updateConfigDataIfNeeded(); // reads the configuration anew when its file changed
+    // An entry of the application's preferences domain, else of configDirectory()/config.plist, else the default.
+    static Value configValueForKey(const std::string& key, Value defaultValue);
+
+    // -- the same for one client
+    bool canReach(CXDAVError& error);
+    const CXDAVAccount& account() const;
+    HttpTransport& transport();
+
+    // -- files
+    bool write(const std::string& text, const Url& url, bool securely) override;
+    bool write(const std::string& text, const Url& url, bool securely, int* code);
+    std::optional<Date> modDateForURL(const Url& url); // the server's, to the second
+    std::optional<Dictionary> dictionaryAtURL(const Url& url, bool securely, int* code);
+    std::optional<Dictionary> dictionaryAtURL(const Url& url, int* errorCode, bool securely) override;
+    bool removeFileAtURL(const Url& url, int* code); // a file or a collection with its contents; absence: 404, true
+    bool removeDirectoryAndContentsAtURL(const Url& url) override;
+    bool createDirectoryAtAURL(const Url& url); // true when it is there afterwards
+    std::optional<FileListing> infoForFilesInContainer(const Url& url) override;
+
+    // Checks the account's own tree: the tree, "People" and its 32 buckets, "info" with "SerialNumber", "dateFile".
+    // One request when all is there. With `create` what is missing is made; nothing that exists is written again.
+    // True when the structure is complete afterwards.
+    bool sanityCheckPublishStructureCreate(bool create);
+
+    // -- access lists (RFC 3744). This client keeps none: the first returns false and leaves the lists empty, the
+    // second returns false, and nothing is sent.
+    virtual bool ACLsAtURL(const Url& url, std::vector<std::string>& readers, std::vector<std::string>& writers);
+    virtual bool setACLsWithReadPrincipals(const std::vector<std::string>& readers,
+                                           const std::vector<std::string>& writers, const Url& url);
+
+    // -- ending: every request under way and every later one fails at once. From any thread or a signal handler.
+    void abortAll();
+
+    struct Impl; // shared with the locks made from this client
+    const std::shared_ptr<Impl>& impl() const { return _impl; }
+
+private:
+    std::shared_ptr<Impl> _impl;
+};
+
+} // namespace rolvane

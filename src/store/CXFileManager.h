@@ -1,0 +1,51 @@
+#pragma once
+
+#include "foundation/Date.h"
+#include "foundation/StrongString.h"
+#include "foundation/Url.h"
+#include "foundation/Value.h"
+
+#include <functional>
+#include <map>
+#include <optional>
+#include <string>
+
+namespace rolvane {
+
+// One entry of a container's listing.
+struct FileInfo {
+    std::string displayName;              // the decoded last path component; never used as a local path
+    std::optional<Date> modificationdate; // a remote version that was never read has the listing's own server date
+    uint64_t size = 0;
+    EntityTag etag; // empty when the store gives none
+    bool isCollection = false;
+};
+// Keyed by path: the decoded path of the entry's URL. Enumerates in byte order of the paths.
+using FileListing = std::map<std::string, FileInfo>;
+
+// Reads and writes files, dictionaries and folders at URLs. The base class serves file URLs; http and https URLs go to
+// CXDAVManager::defaultManager (whose class serves them itself). Any thread. Nothing throws for what a file or a server
+// does; a failure is the absent or false result, with a code where there is an out-argument:
+// an HTTP status for remote URLs (0: no believable answer came); for file URLs 200, 404, 403 or 500.
+class CXFileManager {
+public:
+    virtual ~CXFileManager() = default;
+
+    // The property list dictionary stored at the URL. The code is set in every case when it is given.
+    virtual std::optional<Dictionary> dictionaryAtURL(const Url& url, int* errorCode, bool securely);
+    // Replaces the file's contents by the text (UTF-8). Local files: not atomic, never secure, the folder must exist.
+    virtual bool write(const std::string& text, const Url& url, bool securely);
+    // Absence counts as success.
+    virtual bool removeDirectoryAndContentsAtURL(const Url& url);
+    // What lies in the container, complete or nothing. A remote base location also lists the contact files in the
+    // buckets below its "People"; other containers list their own entries only. Entries with hostile names are left
+    // out.
+    virtual std::optional<FileListing> infoForFilesInContainer(const Url& url);
+
+    // Called, on the thread that needed it, when the network store's password cannot be obtained. One a process; an
+    // empty function takes it away.
+    static void setFailedPasswordHandler(std::function<void()> handler);
+    static void failedToGetPassword(); // calls the handler, if there is one
+};
+
+} // namespace rolvane
