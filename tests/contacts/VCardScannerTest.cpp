@@ -1,0 +1,291 @@
+#include "contacts/VCardScanner.h"
+#include "foundation/CXException.h"
+
+#include <gtest/gtest.h>
+
+#include <fstream>
+#include <memory>
+#include <sstream>
+#include <sys/resource.h>
+
+namespace rolvane {
+namespace {
+
+struct Scan {
+    std::vector<VCard> cards;
+    std::vector<VCardError> errors;
+    uint64_t bytes = 0;
+};
+
+Scan scan(std::istream& in, VCardLimits limits = {}) {
+    Scan result;
+    VCardScanner scanner(
+        in, "test.vcf", [&](const VCardError& e) { result.errors.push_back(e); }, limits);
+    while (auto card = scanner.next()) result.cards.push_back(*card);
+    result.bytes = scanner.bytesRead();
+    return result;
+}
+
+Scan scan(const std::string& text, VCardLimits limits = {}) {
+    std::istringstream in(text);
+    return scan(in, limits);
+}
+
+std::string card(const std::string& lines, const std::string& version = "3.0") {
+    return "BEGIN:VCARD\r\nVERSION:" + version + "\r\n" + lines + "END:VCARD\r\n";
+}
+
+// A stream that makes its text up as it is read, so that a test of a hundred megabytes needs none of them.
+class Endless : public std::streambuf {
+public:
+    Endless(std::string prefix, std::string unit, size_t units, std::string suffix)
+        : _prefix(std::move(prefix)), _unit(std::move(unit)), _suffix(std::move(suffix)), _left(units) {}
+
+protected:
+    int_type underflow() override {
+        if (_stage == 0) {
+            _stage = 1;
+            give(_prefix);
+        } else if (_left > 0) {
+            _left--;
+            give(_unit);
+        } else if (_stage == 1) {
+            _stage = 2;
+            give(_suffix);
+        } else {
+            return traits_type::eof();
+        }
+        return gptr() == egptr() ? underflow() : traits_type::to_int_type(*gptr());
+    }
+
+private:
+    void give(std::string& s) { setg(s.data(), s.data(), s.data() + s.size()); }
+    std::string _prefix, _unit, _suffix;
+    size_t _left;
+    int _stage = 0;
+};
+
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+constexpr long kAllocatorSlack = 1 << 20; // kilobytes; sanitizers hold freed memory back
+#else
+constexpr long kAllocatorSlack = 0;
+#endif
+
+long peakKilobytes() {
+    rusage usage{};
+    getrusage(RUSAGE_SELF, &usage);
+    return usage.ru_maxrss;
+}
+
+TEST(VCardScanner, AFileHoldsManyCardsOfSeveralVersions) {
+    auto r = scan(card("FN:A\r\n") + "\r\n" + card("FN:B\r\n", "4.0") + card("FN:C\r\n", "2.1"));
+    ASSERT_EQ(r.cards.size(), 3u);
+    EXPECT_TRUE(r.errors.empty());
+    EXPECT_EQ(r.cards[0].version, "3.0");
+    EXPECT_EQ(r.cards[1].version, "4.0");
+    EXPECT_EQ(r.cards[2].lines.at(0).value, "C");
+    EXPECT_EQ(r.cards[1].firstLine, 6u);
+}
+
+TEST(VCardScanner, AnEmptyFileHasNoCardAndNoError) {
+    EXPECT_TRUE(scan("").errors.empty());
+    EXPECT_TRUE(scan("\n\n").errors.empty());
+}
+
+TEST(VCardScanner, LinesMayEndInLineFeedOrCarriageReturnAlone) {
+    for (const char* end : {"\n", "\r"}) {
+        std::string text;
+        for (const char* l : {"BEGIN:VCARD", "VERSION:3.0", "NOTE:one", "  two", "END:VCARD"}) (text += l) += end;
+        auto r = scan(text);
+        ASSERT_EQ(r.cards.size(), 1u);
+        EXPECT_EQ(r.cards[0].lines.at(0).value, "one two");
+        EXPECT_EQ(r.cards[0].lines.at(0).number, 3u);
+    }
+}
+
+TEST(VCardScanner, AByteOrderMarkIsPassedOver) {
+    auto r = scan("\xEF\xBB\xBF" + card("FN:A\r\n"));
+    EXPECT_EQ(r.cards.size(), 1u);
+    EXPECT_TRUE(r.errors.empty());
+}
+
+TEST(VCardScanner, AFileInUTF16IsRefusedWithAReason) {
+    for (const std::string& start :
+         {std::string("\xFF\xFE"
+                      "B\0",
+                      4),
+          std::string("\xFE\xFF\0B", 4), std::string("B\0E\0", 4), std::string("\0B\0E", 4)}) {
+        auto r = scan(start + std::string("\0E\0G\0I\0N", 8));
+        EXPECT_TRUE(r.cards.empty());
+        ASSERT_EQ(r.errors.size(), 1u);
+        EXPECT_NE(r.errors[0].reason.find("UTF-16"), std::string::npos);
+        EXPECT_EQ(r.errors[0].description(), "test.vcf:1: " + r.errors[0].reason);
+    }
+}
+
+TEST(VCardScanner, FoldsThatCutACharacterAreJoinedBeforeItIsJudged) {
+    auto r = scan(card("FN:caf\xC3\r\n \xA9\r\n"));
+    ASSERT_EQ(r.cards.size(), 1u);
+    EXPECT_EQ(r.cards[0].lines[0].value, "café");
+}
+
+TEST(VCardScanner, ACardInLatin1IsBadAndItsNeighboursAreNot) {
+    auto r = scan(card("FN:A\r\n") + card("UID:x\r\nFN:Ren\xE9\r\nNOTE:more\r\n") + card("FN:B\r\n"));
+    ASSERT_EQ(r.cards.size(), 2u);
+    EXPECT_EQ(r.cards[1].lines[0].value, "B");
+    ASSERT_EQ(r.errors.size(), 1u);
+    EXPECT_EQ(r.errors[0].line, 8u);
+    EXPECT_EQ(r.errors[0].reason, "the text is not UTF-8");
+}
+
+TEST(VCardScanner, ACharacterSetThatIsNamedIsConverted) {
+    auto r = scan(
+        card("FN;CHARSET=ISO-8859-1:Ren\xE9\r\nNOTE;CHARSET=SHIFT_JIS;ENCODING=QUOTED-PRINTABLE:=93=FA\r\n", "2.1"));
+    ASSERT_EQ(r.cards.size(), 1u);
+    EXPECT_EQ(r.cards[0].lines[0].value, "René");
+    EXPECT_EQ(r.cards[0].lines[1].value, "日");
+    EXPECT_TRUE(r.cards[0].lines[1].parameters.empty());
+    auto bad = scan(card("FN;CHARSET=KLINGON:x\r\n", "2.1"));
+    ASSERT_EQ(bad.errors.size(), 1u);
+    EXPECT_NE(bad.errors[0].reason.find("KLINGON"), std::string::npos);
+}
+
+TEST(VCardScanner, QuotedPrintableTextGoesOnAfterASoftBreak) {
+    auto r = scan(card("NOTE;QUOTED-PRINTABLE:one=0D=0Atwo =C3=\r\n=A4 =3D=\r\n three\r\nFN:x\r\n", "2.1"));
+    ASSERT_EQ(r.cards.size(), 1u);
+    EXPECT_EQ(r.cards[0].lines[0].value, "one\\ntwo ä = three");
+    EXPECT_EQ(r.cards[0].lines[1].value, "x");
+}
+
+TEST(VCardScanner, Base64OfOldCardsMayStandAtTheLeftMargin) {
+    std::string unit(64, 'A');
+    auto r = scan(card("PHOTO;PNG;BASE64:" + unit + "\r\n" + unit + "\r\n " + unit + "\r\n\r\nFN:x\r\n", "2.1"));
+    ASSERT_EQ(r.cards.size(), 1u);
+    EXPECT_EQ(r.cards[0].lines[0].value.size(), 192u);
+    EXPECT_EQ(r.cards[0].lines[1].value, "x");
+}
+
+TEST(VCardScanner, ACardInsideAnAgentIsKeptAsItsText) {
+    auto r = scan(card("FN:boss\r\nAGENT:\r\nBEGIN:VCARD\r\nFN:help\r\nEND:VCARD\r\nTEL:1\r\n", "2.1"));
+    ASSERT_EQ(r.cards.size(), 1u);
+    EXPECT_TRUE(r.errors.empty());
+    EXPECT_EQ(vcardUnescape(r.cards[0].lines[1].value), "BEGIN:VCARD\nFN:help\nEND:VCARD");
+    EXPECT_EQ(r.cards[0].lines[2].name, "TEL");
+}
+
+TEST(VCardScanner, ACardThatBeginsInsideAnotherEndsTheBadOne) {
+    auto r = scan("BEGIN:VCARD\r\nVERSION:3.0\r\nFN:open\r\n" + card("FN:good\r\n"));
+    ASSERT_EQ(r.cards.size(), 1u);
+    EXPECT_EQ(r.cards[0].lines[0].value, "good");
+    ASSERT_EQ(r.errors.size(), 1u);
+    EXPECT_EQ(r.errors[0].line, 1u);
+    EXPECT_NE(r.errors[0].reason.find("END:VCARD"), std::string::npos);
+}
+
+TEST(VCardScanner, AFileThatEndsInsideACardNamesTheCard) {
+    auto r = scan(card("FN:A\r\n") + "BEGIN:VCARD\r\nVERSION:3.0\r\nFN:cut o");
+    EXPECT_EQ(r.cards.size(), 1u);
+    ASSERT_EQ(r.errors.size(), 1u);
+    EXPECT_EQ(r.errors[0].line, 5u);
+    EXPECT_NE(r.errors[0].reason.find("the file ends"), std::string::npos);
+}
+
+TEST(VCardScanner, ALineThatIsNoPropertyMakesTheCardBadAtThatLine) {
+    auto r = scan(card("FN:A\r\nthis is no property\r\nTEL:1\r\n") + card("FN:B\r\n"));
+    ASSERT_EQ(r.cards.size(), 1u);
+    ASSERT_EQ(r.errors.size(), 1u);
+    EXPECT_EQ(r.errors[0].line, 4u);
+}
+
+TEST(VCardScanner, AnUnknownVersionIsRefused) {
+    auto r = scan(card("FN:A\r\n", "7.5") + card("FN:B\r\n"));
+    ASSERT_EQ(r.cards.size(), 1u);
+    ASSERT_EQ(r.errors.size(), 1u);
+    EXPECT_NE(r.errors[0].reason.find("7.5"), std::string::npos);
+}
+
+TEST(VCardScanner, AControlCharacterMakesTheCardBad) {
+    auto r = scan(card("FN:A\x01\r\n") + card(std::string("FN:B\0C\r\n", 8)) +
+                  card("NOTE;ENCODING=QUOTED-PRINTABLE:=0C\r\n", "2.1"));
+    EXPECT_TRUE(r.cards.empty());
+    EXPECT_EQ(r.errors.size(), 3u);
+}
+
+TEST(VCardScanner, TextOutsideCardsIsReportedOnceAStretch) {
+    auto r = scan("hello\r\nworld\r\n" + card("FN:A\r\n") + "bye\r\n");
+    EXPECT_EQ(r.cards.size(), 1u);
+    ASSERT_EQ(r.errors.size(), 2u);
+    EXPECT_EQ(r.errors[0].line, 1u);
+    EXPECT_EQ(r.errors[1].line, 7u);
+}
+
+TEST(VCardScanner, AnEndlessLineCostsItsCardAndNoMemory) {
+    std::string mb(1 << 20, 'x');
+    Endless source("BEGIN:VCARD\r\nVERSION:3.0\r\nNOTE:", mb, 100, "\r\nEND:VCARD\r\n" + card("FN:good\r\n"));
+    std::istream in(&source);
+    long before = peakKilobytes();
+    auto r = scan(in);
+    EXPECT_LT(peakKilobytes() - before, (80 << 10) + kAllocatorSlack);
+    EXPECT_EQ(r.cards.size(), 1u);
+    ASSERT_EQ(r.errors.size(), 1u);
+    EXPECT_EQ(r.errors[0].line, 3u);
+    EXPECT_EQ(r.errors[0].reason, "the line is longer than 1 MB");
+    EXPECT_GT(r.bytes, 100u << 20);
+}
+
+TEST(VCardScanner, ALineFoldedWithoutEndIsCappedToo) {
+    std::string block;
+    while (block.size() < 1 << 20) block += " folded text that goes on and on and on\r\n";
+    Endless source("BEGIN:VCARD\r\nVERSION:3.0\r\nNOTE:x\r\n", block, 20, "END:VCARD\r\n" + card("FN:good\r\n"));
+    std::istream in(&source);
+    auto r = scan(in);
+    EXPECT_EQ(r.cards.size(), 1u);
+    ASSERT_EQ(r.errors.size(), 1u);
+    EXPECT_EQ(r.errors[0].line, 3u);
+}
+
+TEST(VCardScanner, ACardWithoutEndIsCapped) {
+    std::string block;
+    while (block.size() < 1 << 20) block += "TEL:+1 555 0100\r\n";
+    Endless source("BEGIN:VCARD\r\nVERSION:3.0\r\n", block, 3, card("FN:good\r\n"));
+    std::istream in(&source);
+    auto r = scan(in, {.cardBytes = 2 << 20});
+    EXPECT_EQ(r.cards.size(), 1u);
+    ASSERT_EQ(r.errors.size(), 1u);
+    EXPECT_EQ(r.errors[0].reason, "the card is longer than 2 MB");
+}
+
+TEST(VCardScanner, APhotoMayBeLongerThanOtherLines) {
+    VCardLimits limits{.lineBytes = 1000, .photoLineBytes = 5000, .cardBytes = 100000};
+    std::string data(4000, 'A');
+    EXPECT_EQ(scan(card("PHOTO;ENCODING=b:" + data + "\r\n"), limits).cards.size(), 1u);
+    EXPECT_EQ(scan(card("item1.photo:" + data + "\r\n"), limits).cards.size(), 1u);
+    EXPECT_EQ(scan(card("NOTE:" + data + "\r\n"), limits).errors.size(), 1u);
+    EXPECT_EQ(scan(card("PHOTO:" + data + data + "\r\n"), limits).errors.size(), 1u);
+}
+
+TEST(VCardScanner, AHundredMegabytesOfCardsPassInConstantMemory) {
+    std::string block;
+    while (block.size() < 1 << 20) block += card("N:Doe;Jo;;;\r\nFN:Jo Doe\r\nNOTE:" + std::string(4000, 'n') + "\r\n");
+    Endless source("", block, 100, ""); // a hundred megabytes
+    std::istream in(&source);
+    size_t cards = 0, errors = 0;
+    VCardScanner scanner(in, "big.vcf", [&](const VCardError&) { errors++; });
+    long before = peakKilobytes();
+    while (scanner.next()) cards++;
+    EXPECT_LT(peakKilobytes() - before, (8 << 10) + kAllocatorSlack);
+    EXPECT_GT(cards, 20000u);
+    EXPECT_EQ(errors, 0u);
+}
+
+TEST(VCardScanner, AStreamThatCannotBeReadIsAnException) {
+    struct Broken : std::streambuf {
+        int_type underflow() override { throw std::ios_base::failure("gone"); }
+    } broken;
+    std::istream in(&broken);
+    VCardScanner scanner(in, "gone.vcf", [](const VCardError&) {});
+    EXPECT_THROW(scanner.next(), CXException);
+}
+
+} // namespace
+} // namespace rolvane
