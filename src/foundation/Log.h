@@ -11,7 +11,8 @@
 namespace rolvane {
 
 // Where log lines go: the journal (structured fields), or standard error where there is no journal or standard error
-// is a terminal. Exists so that tests can replace it. Called from any thread; must not throw.
+// is a terminal or $ROLVANE_LOG is "stderr" (chosen at the first line of the process). Exists so that tests can
+// replace it. Called from any thread; must not throw.
 class LogSink {
 public:
     virtual ~LogSink() = default;
@@ -49,7 +50,10 @@ std::string describeRange(const T& range);
 
 template <class T>
 std::string describeObject(const T& value) {
-    if constexpr (std::is_convertible_v<T, std::string>)
+    if constexpr (std::is_same_v<std::decay_t<T>, const char*> || std::is_same_v<std::decay_t<T>, char*>) {
+        const char* text = value;
+        return text ? text : "(null)";
+    } else if constexpr (std::is_convertible_v<T, std::string>)
         return value;
     else if constexpr (std::is_convertible_v<T, std::string_view>)
         return std::string(std::string_view(value));
@@ -61,6 +65,8 @@ std::string describeObject(const T& value) {
         return value.description();
     else if constexpr (HasDescriptionFunction<T>)
         return description(value);
+    else if constexpr (std::is_enum_v<T>)
+        return std::to_string(static_cast<std::underlying_type_t<T>>(value));
     else if constexpr (requires {
                            *value;
                            static_cast<bool>(value);
@@ -83,6 +89,8 @@ LogArgument logArgument(const T& value) {
     return {describeObject(value)};
 }
 
+// Placeholders may carry the printf flags '-' and '0', a width, and a precision (digits after the point of "%f",
+// longest text of "%s"). A placeholder without an argument stays as it is written; surplus arguments are not shown.
 std::string formatLog(std::string_view format, const std::vector<LogArgument>& arguments);
 void writeLog(std::string_view line);
 

@@ -13,9 +13,13 @@ namespace rolvane {
 // visible to this process's reads at once, until `synchronize` writes them in one transaction; reads of keys that have
 // no unwritten change see what other processes have synchronised. Values are BinaryValue blobs. Any thread.
 // A damaged file throws kCXPreferencesException that names the file and says how to go on; it is never overwritten.
+// So do a locked file (after the lock timeout), a read-only one and a full disk: nothing of the transaction is written,
+// and the changes stay in memory for the next `synchronize`. Several processes may use one file at a time. A value is
+// copied when it is set: what happens to its containers afterwards changes nothing here.
 class Preferences {
 public:
-    explicit Preferences(std::string path); // the file is made on the first write, mode 0600, directories 0700
+    // The file is made on the first write, mode 0600, directories 0700. Nothing is opened before it is needed.
+    explicit Preferences(std::string path, double lockTimeoutSeconds = 4);
     ~Preferences();
     Preferences(const Preferences&) = delete;
     Preferences& operator=(const Preferences&) = delete;
@@ -24,11 +28,12 @@ public:
     void set(std::string_view domain, std::string_view key, Value value); // an absent value removes
     void remove(std::string_view domain, std::string_view key);
     void synchronize(std::string_view domain);
-    std::vector<std::string> keys(std::string_view domain) const;
-    std::vector<std::string> domains() const;
+    std::vector<std::string> keys(std::string_view domain) const; // in byte order, unwritten changes included
+    std::vector<std::string> domains() const;                     // those with a key, in byte order
     const std::string& path() const;
 
-    static Preferences& shared(); // $XDG_STATE_HOME/rolvane/preferences.db
+    // stateDirectory()/preferences.db, found anew at every call: one object a path, living for the process.
+    static Preferences& shared();
 
 private:
     struct Impl;

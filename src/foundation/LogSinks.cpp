@@ -1,0 +1,73 @@
+#include "foundation/LogSinks.h"
+
+#include "foundation/Date.h"
+
+#include <cerrno>
+#include <cstdio>
+
+#include <fmt/format.h>
+#include <sys/syscall.h>
+#include <sys/uio.h>
+#include <unistd.h>
+
+#define SD_JOURNAL_SUPPRESS_LOCATION
+#include <systemd/sd-journal.h>
+
+namespace rolvane {
+
+namespace {
+
+constexpr int kPriorityNotice = 5;
+
+void writeFully(int fd, std::string_view bytes) {
+    while (!bytes.empty()) {
+        ssize_t n = ::write(fd, bytes.data(), bytes.size());
+        if (n < 0 && errno == EINTR) continue;
+        if (n <= 0) return; // there is nobody left to tell
+        bytes.remove_prefix(static_cast<size_t>(n));
+    }
+}
+
+} // namespace
+
+LogDestination chooseLogDestination(std::string_view request, bool journalSocketExists, bool standardErrorIsTerminal) {
+    if (request == "stderr" || !journalSocketExists) return LogDestination::standardError;
+    if (request == "journal") return LogDestination::journal;
+    return standardErrorIsTerminal ? LogDestination::standardError : LogDestination::journal;
+}
+
+std::vector<std::string> journalFields(std::string_view line, std::string_view identifier) {
+    return {fmt::format("MESSAGE={}", line), fmt::format("PRIORITY={}", kPriorityNotice),
+            fmt::format("SYSLOG_IDENTIFIER={}", identifier), fmt::format("TID={}", ::syscall(SYS_gettid))};
+}
+
+std::string standardErrorLine(std::string_view line, std::string_view identifier) {
+    std::string out =
+        fmt::format("{} {}[{}]: ", Clock::system().now().toISO8601Precise(), identifier, static_cast<long>(getpid()));
+    for (char c : line) {
+        auto byte = static_cast<unsigned char>(c);
+        if (c == '\n')
+            out += "\n\t";
+        else if ((byte < 0x20 && c != '\t') || byte == 0x7f)
+            out += fmt::format("\\x{:02x}", byte);
+        else
+            out += c;
+    }
+    return out += '\n';
+}
+
+void JournalSink::write(std::string_view line) {
+    auto fields = journalFields(line, program_invocation_short_name);
+    std::vector<iovec> vectors;
+    for (auto& field : fields) vectors.push_back({field.data(), field.size()});
+    if (sd_journal_sendv(vectors.data(), static_cast<int>(vectors.size())) < 0)
+        writeFully(STDERR_FILENO, standardErrorLine(line, program_invocation_short_name));
+}
+
+void StandardErrorSink::write(std::string_view line) {
+    std::string text = standardErrorLine(line, program_invocation_short_name);
+    std::lock_guard guard(_mutex);
+    writeFully(STDERR_FILENO, text);
+}
+
+} // namespace rolvane

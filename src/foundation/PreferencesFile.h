@@ -1,0 +1,66 @@
+#pragma once
+
+#include "foundation/Value.h"
+
+#include <map>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+struct sqlite3;
+struct sqlite3_stmt;
+
+namespace rolvane {
+
+// The SQLite file beneath Preferences: rows of (domain, key, bytes). Journal in WAL form, where the file system can
+// carry it: a commit costs one flush, and readers never wait for a writer. One thread at a time. Every operation opens
+// the file when there is one and notices when it was moved away or removed meanwhile. Failures throw
+// kCXPreferencesException and leave the file as it was.
+class PreferencesFile {
+public:
+    using Changes = std::map<std::string, std::optional<Bytes>, std::less<>>; // no bytes: removal
+
+    PreferencesFile(std::string path, double lockTimeoutSeconds);
+    ~PreferencesFile();
+    PreferencesFile(const PreferencesFile&) = delete;
+    PreferencesFile& operator=(const PreferencesFile&) = delete;
+
+    std::optional<Bytes> read(std::string_view domain, std::string_view key);
+    std::vector<std::string> keys(std::string_view domain);
+    std::vector<std::string> domains();
+    void write(std::string_view domain, const Changes& changes); // one transaction, on the disk when it returns
+    const std::string& path() const { return _path; }
+
+private:
+    struct StatementCloser {
+        void operator()(sqlite3_stmt* statement) const;
+    };
+    using Statement = std::unique_ptr<sqlite3_stmt, StatementCloser>;
+
+    bool openExisting(); // false: there is no file, or no table in it yet
+    void openOrCreate();
+    void createFile();
+    void open();
+    void close();
+    bool hasMoved() const;
+    void checkFormat();
+    bool hasTable();
+    int64_t number(const char* sql);
+    void execute(const char* sql);
+    void rollBack() noexcept;
+    void applyChanges(std::string_view domain, const Changes& changes);
+    std::vector<std::string> strings(const char* sql, std::optional<std::string_view> argument);
+    Statement prepare(const char* sql);
+    bool step(sqlite3_stmt* statement);
+    void bindText(sqlite3_stmt* statement, int index, std::string_view text);
+    [[noreturn]] void fail(int code) const;
+
+    std::string _path;
+    double _lockTimeout;
+    sqlite3* _db = nullptr;
+    bool _tableSeen = false;
+};
+
+} // namespace rolvane
