@@ -30,6 +30,7 @@ inline constexpr const char* kCXDatabaseException = "CXDatabaseException";
 inline constexpr const char* kCXPreferencesException = "CXPreferencesException";
 inline constexpr const char* kCXPropertyListException = "CXPropertyListException";
 inline constexpr const char* kCXArchiveException = "CXArchiveException";
+inline constexpr const char* kCXFileException = "CXFileException";
 inline constexpr const char* kCXNetworkException = "CXNetworkException";
 
 } // namespace rolvane

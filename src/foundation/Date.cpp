@@ -1,7 +1,7 @@
 #include "foundation/Date.h"
 
+#include <algorithm>
 #include <array>
-#include <charconv>
 #include <cmath>
 #include <cstdio>
 #include <ctime>
@@ -17,11 +17,18 @@ constexpr std::array<const char*, 12> kMonths{"Jan", "Feb", "Mar", "Apr", "May",
 
 struct Civil {
     int year, month, day, hour, minute, second, weekday;
-    double fraction;
 };
+
+constexpr double kFirst = -62135596800.0; // 0001-01-01T00:00:00Z
+constexpr double kEnd = 253402300800.0;   // 10000-01-01T00:00:00Z
+
+bool inRange(double seconds) {
+    return seconds >= kFirst && seconds < kEnd;
+}
 
 Civil civil(double seconds) {
     using namespace std::chrono;
+    if (!inRange(seconds)) seconds = std::isnan(seconds) ? 0 : seconds < kFirst ? kFirst : kEnd - 1;
     const double whole = std::floor(seconds);
     const sys_seconds at{std::chrono::seconds{static_cast<int64_t>(whole)}};
     const auto midnight = floor<days>(at);
@@ -33,8 +40,7 @@ Civil civil(double seconds) {
             static_cast<int>(time.hours().count()),
             static_cast<int>(time.minutes().count()),
             static_cast<int>(time.seconds().count()),
-            static_cast<int>(weekday{midnight}.c_encoding()),
-            seconds - whole};
+            static_cast<int>(weekday{midnight}.c_encoding())};
 }
 
 std::optional<double> fromCivil(int y, int mo, int d, int h, int mi, int s) {
@@ -62,6 +68,31 @@ bool literal(std::string_view& text, char c) {
     return true;
 }
 
+// Takes ".25"; 0 when there is no point, nothing when no digit follows it.
+std::optional<double> fraction(std::string_view& text) {
+    if (!literal(text, '.')) return 0.0;
+    const size_t size = std::min(text.find_first_not_of("0123456789"), text.size());
+    if (size == 0) return std::nullopt;
+    double part = 0, unit = 0.1;
+    for (const char c : text.substr(0, size)) {
+        part += (c - '0') * unit;
+        unit /= 10;
+    }
+    text.remove_prefix(size);
+    return part;
+}
+
+// Takes "Z", "+01:30" or "+0130"; the offset in seconds.
+std::optional<double> offsetFromUTC(std::string_view& text) {
+    if (literal(text, 'Z')) return 0.0;
+    const double sign = !text.empty() && text[0] == '-' ? -1 : 1;
+    int hours, minutes;
+    if (!(literal(text, '+') || literal(text, '-')) || !number(text, 2, hours)) return std::nullopt;
+    literal(text, ':');
+    if (!number(text, 2, minutes) || hours > 23 || minutes > 59) return std::nullopt;
+    return sign * (hours * 3600 + minutes * 60);
+}
+
 int monthNamed(std::string_view name) {
     for (size_t i = 0; i < kMonths.size(); ++i)
         if (name == kMonths[i]) return static_cast<int>(i) + 1;
@@ -70,15 +101,23 @@ int monthNamed(std::string_view name) {
 
 } // namespace
 
+bool Date::isRepresentable() const {
+    return inRange(_seconds);
+}
+
 std::string Date::toISO8601() const {
     const Civil c = civil(_seconds);
     return fmt::format("{:04}-{:02}-{:02}T{:02}:{:02}:{:02}Z", c.year, c.month, c.day, c.hour, c.minute, c.second);
 }
 
 std::string Date::toISO8601Precise() const {
-    const Civil c = civil(_seconds);
+    const double whole = std::floor(_seconds);
+    double micros = std::round((_seconds - whole) * 1e6);
+    const bool carry = micros >= 1e6;
+    if (carry || !isRepresentable()) micros = 0;
+    const Civil c = civil(carry ? whole + 1 : whole);
     return fmt::format("{:04}-{:02}-{:02}T{:02}:{:02}:{:02}.{:06}Z", c.year, c.month, c.day, c.hour, c.minute, c.second,
-                       static_cast<int>(c.fraction * 1e6));
+                       static_cast<int>(micros));
 }
 
 std::string Date::toHTTP() const {
@@ -93,26 +132,12 @@ std::optional<Date> Date::fromISO8601(std::string_view t) {
         !(literal(t, 'T') || literal(t, ' ')) || !number(t, 2, h) || !literal(t, ':') || !number(t, 2, mi) ||
         !literal(t, ':') || !number(t, 2, s))
         return std::nullopt;
-    double fraction = 0, unit = 0.1;
-    if (literal(t, '.'))
-        while (!t.empty() && t[0] >= '0' && t[0] <= '9') {
-            fraction += (t[0] - '0') * unit;
-            unit /= 10;
-            t.remove_prefix(1);
-        }
-    int offset = 0;
-    if (!literal(t, 'Z')) {
-        const bool minus = !t.empty() && t[0] == '-';
-        int oh, om;
-        if (!(literal(t, '+') || literal(t, '-')) || !number(t, 2, oh)) return std::nullopt;
-        literal(t, ':');
-        if (!number(t, 2, om)) return std::nullopt;
-        offset = (oh * 3600 + om * 60) * (minus ? -1 : 1);
-    }
-    if (!t.empty()) return std::nullopt;
+    const auto part = fraction(t);
+    const auto offset = part ? offsetFromUTC(t) : std::nullopt;
     const auto seconds = fromCivil(y, mo, d, h, mi, s);
-    if (!seconds) return std::nullopt;
-    return Date(*seconds + fraction - offset);
+    if (!part || !offset || !t.empty() || !seconds) return std::nullopt;
+    const Date date(*seconds + *part - *offset);
+    return date.isRepresentable() ? std::optional<Date>(date) : std::nullopt;
 }
 
 std::optional<Date> Date::fromHTTP(std::string_view text) {
@@ -137,7 +162,7 @@ std::optional<Date> Date::fromHTTP(std::string_view text) {
     const int mo = monthNamed(month);
     if (!mo) return std::nullopt;
     const auto seconds = fromCivil(y, mo, d, h, mi, sec);
-    return seconds ? std::optional<Date>(Date(*seconds)) : std::nullopt;
+    return seconds && inRange(*seconds) ? std::optional<Date>(Date(*seconds)) : std::nullopt;
 }
 
 namespace {

@@ -22,14 +22,18 @@ public:
     constexpr Date addingSeconds(double s) const { return Date(_seconds + s); }
     constexpr double secondsSince(Date other) const { return _seconds - other._seconds; }
 
+    // Whether the texts below can say it: a finite number within the years 1 to 9999. Those of any other date are of
+    // the nearest end of that time (1970 for one that is no number).
+    bool isRepresentable() const;
     // "2026-11-20T23:48:00Z", whole seconds, rounded towards the past (XML property lists, RFC 3339 section 5.6).
     std::string toISO8601() const;
-    // The same with microseconds, for logs and listings.
+    // The same rounded to microseconds, for logs and listings.
     std::string toISO8601Precise() const;
     // "Fri, 20 Nov 2026 23:48:00 GMT" (IMF-fixdate, RFC 9110 section 5.6.7).
     std::string toHTTP() const;
 
-    // Each gives nothing for text that is not such a date; fractions of a second are accepted by the first.
+    // Each gives nothing for text that is not such a date or is not representable. The first accepts fractions of a
+    // second and offsets from UTC.
     static std::optional<Date> fromISO8601(std::string_view text);
     static std::optional<Date> fromHTTP(std::string_view text); // all three forms that RFC 9110 section 5.6.7 names
 

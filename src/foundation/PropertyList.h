@@ -1,5 +1,6 @@
 #pragma once
 
+#include "foundation/BinaryValue.h"
 #include "foundation/Value.h"
 
 #include <string>
@@ -12,29 +13,23 @@ struct PropertyListLimits {
     int maxDepth = 64;
 };
 
-// XML property lists. The writer is deterministic: equal values give equal bytes; UTF-8, tab indentation, keys in byte
-// order. Characters that XML 1.0 cannot carry are refused with kCXPropertyListException naming the key.
-// The reader refuses a DTD other than the standard external identifier without an internal subset, every entity but
-// the five predefined ones, depth over the limit, and text over the size limit; it never opens a file or a connection.
+// XML property lists.
+// Writer: deterministic (equal values of equal types give equal bytes), UTF-8, tab indentation, keys in byte order.
+// Reals are written in the shortest form that reads back as the same number, "nan", "+infinity" and "-infinity" by
+// name; dates with whole seconds, rounded towards the past. Refused with kCXPropertyListException, naming the place:
+// text that is not UTF-8 or has a character that XML 1.0 cannot carry, dates outside the years 1 to 9999, absent
+// values, and containers nested deeper than the default limit (a container that holds itself among them).
+// Reader: UTF-8, or UTF-16 with a byte order mark. It refuses a document type other than `plist` with an external
+// identifier and no internal subset, every entity but the five predefined ones, duplicate keys, tags longer than 512
+// bytes, nesting over the depth limit and text over the size limit. It never opens a file or a connection for what a
+// document names.
 class PropertyList {
 public:
     static std::string toXML(const Value& value);
-    // Throws kCXPropertyListException with line and reason.
+    // Throws kCXPropertyListException with line and reason. Any thread.
     static Value fromXML(std::string_view text, const PropertyListLimits& limits = {});
+    // The same with the path in the reason; kCXFileException when the file cannot be read.
     static Value fromFile(const std::string& path, const PropertyListLimits& limits = {});
-};
-
-// A compact binary form of a Value for rows and archives:
-//   value  = tag payload      tag: one byte, the ValueType (booleans 0x10 false, 0x11 true)
-//   integer = zigzag varint, real/date = 8 bytes little endian IEEE 754, string/data = varint length + bytes,
-//   array = varint count + values, dictionary = varint count + (string value)* in ascending key order
-// Equal values give equal bytes. Decoding checks every length and depth (64) and throws kCXArchiveException.
-class BinaryValue {
-public:
-    static Bytes encode(const Value& value);
-    static void encodeTo(const Value& value, Bytes& out);
-    static Value decode(const uint8_t* data, size_t size);
-    static Value decode(const Bytes& bytes) { return decode(bytes.data(), bytes.size()); }
 };
 
 } // namespace rolvane

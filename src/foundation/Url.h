@@ -8,13 +8,15 @@
 namespace rolvane {
 
 // A URL (RFC 3986), immutable, kept as the text it was parsed from: `absoluteString` gives that text back.
-// Equality is of the text.
+// Equality is of the text. Parsing refuses every character outside the RFC's set (spaces, controls, non-ASCII,
+// malformed escapes), and http and https without a host.
 class Url {
 public:
     Url() = default;                                        // the empty URL
     static std::optional<Url> parse(std::string_view text); // nothing when there is no scheme, or on malformed text
     explicit Url(std::string_view text);                    // as parse; throws kCXInvalidArgumentException instead
-    static Url fileURL(std::string_view path);              // "file:" + the percent-encoded absolute path
+    // "file:" + the percent-encoded absolute path, which throws kCXInvalidArgumentException when it is relative.
+    static Url fileURL(std::string_view path);
 
     const std::string& absoluteString() const { return _text; }
     std::string scheme() const; // as written
@@ -27,9 +29,16 @@ public:
     std::vector<std::string> pathComponents() const;
 
     std::string cxLastComponent() const; // decoded; "" for the root or an empty path
-    // Appends one component, percent-encoded (a '/' inside it becomes %2F). No trailing slash is written.
+    // Appends one component, percent-encoded so that it stays one whatever it holds: '/' becomes %2F, and a component
+    // "." or ".." becomes %2E or %2E%2E. One slash stands between, none at the end; query and fragment are dropped.
+    // An empty component (it would name the container itself) throws kCXInvalidArgumentException, as does an empty URL.
     Url cxURLByAppendingComponent(std::string_view component) const;
-    Url cxURLByDeletingLastComponent() const; // no trailing slash but for the root
+    // Without trailing slash but for the root, which stays; query and fragment are dropped.
+    Url cxURLByDeletingLastComponent() const;
+    // The local path of a file URL. kCXInvalidArgumentException when it is no file URL of this machine, when its path
+    // is relative, or when a decoded component is "." or "..", or holds '/' or a zero byte: no name leaves its
+    // directory.
+    std::string filePath() const;
     Url withScheme(std::string_view scheme) const;
 
     friend bool operator==(const Url&, const Url&) = default;

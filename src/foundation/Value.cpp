@@ -19,31 +19,28 @@ struct StringHash {
 
 } // namespace
 
-// `index` counts the string elements; built on first need, absent until then and after a write that it cannot follow.
+// `index` counts the string elements: built on first need, dropped after a write that it cannot follow.
 struct Array::Storage {
+    using Index = std::unordered_map<std::string, size_t, StringHash, std::equal_to<>>;
     std::vector<Value> items;
-    mutable std::unordered_map<std::string, size_t, StringHash, std::equal_to<>> index;
-    mutable bool indexed = false;
+    mutable std::unique_ptr<Index> index;
 
-    const std::unordered_map<std::string, size_t, StringHash, std::equal_to<>>& counted() const {
-        if (!indexed) {
-            index.clear();
-            index.reserve(items.size());
-            for (const Value& v : items)
-                if (const std::string* s = v.stringIf()) ++index[*s];
-            indexed = true;
+    const Index& counted() const {
+        if (!index) {
+            index = std::make_unique<Index>(items.size());
+            for (const Value& v : items) added(v);
         }
-        return index;
+        return *index;
     }
-    void added(const Value& v) {
-        if (!indexed) return;
-        if (const std::string* s = v.stringIf()) ++index[*s];
+    void added(const Value& v) const {
+        if (!index) return;
+        if (const std::string* s = v.stringIf()) ++(*index)[*s];
     }
     void removed(const Value& v) {
-        if (!indexed) return;
+        if (!index) return;
         const std::string* s = v.stringIf();
         if (!s) return;
-        if (auto it = index.find(*s); it != index.end() && --it->second == 0) index.erase(it);
+        if (auto it = index->find(*s); it != index->end() && --it->second == 0) index->erase(it);
     }
 };
 
@@ -108,7 +105,7 @@ void Array::removeAll(const Value& v) {
     const Value wanted = v; // v may live inside this array
     if (!contains(wanted)) return;
     std::erase(_p->items, wanted);
-    if (const std::string* s = wanted.stringIf(); s && _p->indexed) _p->index.erase(*s);
+    if (const std::string* s = wanted.stringIf(); s && _p->index) _p->index->erase(*s);
 }
 
 void Array::removeAllOf(const Array& others) {
@@ -116,7 +113,7 @@ void Array::removeAllOf(const Array& others) {
     const Array gone = others.isSame(*this) ? others.mutableCopy() : others;
     const size_t before = count();
     std::erase_if(_p->items, [&](const Value& v) { return gone.contains(v); });
-    if (count() != before) _p->indexed = false;
+    if (count() != before) _p->index.reset();
 }
 
 bool Array::contains(const Value& v) const {
@@ -125,7 +122,7 @@ bool Array::contains(const Value& v) const {
 }
 
 bool Array::containsString(std::string_view s) const {
-    if (count() >= kIndexFrom || _p->indexed) {
+    if (count() >= kIndexFrom || _p->index) {
         const auto& index = _p->counted();
         return index.find(s) != index.end();
     }
@@ -182,6 +179,15 @@ void Dictionary::set(std::string_view key, Value v) {
         it->second = std::move(v);
     else
         _p->emplace(std::string(key), std::move(v));
+}
+
+bool Dictionary::setIfNew(std::string&& key, Value v) {
+    if (v.isAbsent())
+        throw CXException(kCXInvalidArgumentException,
+                          fmt::format("an absent value cannot be stored in a dictionary (key \"{}\")", key));
+    const size_t before = _p->size();
+    _p->try_emplace(_p->end(), std::move(key), std::move(v)); // the hint makes ascending keys cheap
+    return _p->size() != before;
 }
 
 void Dictionary::remove(std::string_view key) {

@@ -77,6 +77,7 @@ public:
     const Value& operator[](std::string_view key) const; // the absent value when there is none
     bool contains(std::string_view key) const;
     void set(std::string_view key, Value v);
+    bool setIfNew(std::string&& key, Value v); // false, and nothing changed, when the key is there already
     void remove(std::string_view key);
     void addEntriesFrom(const Dictionary& other); // other's entries win
     std::vector<std::string> allKeys() const;
