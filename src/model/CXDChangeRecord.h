@@ -86,6 +86,10 @@ public:
     // in-memory payload. Without a delayed payload: the in-memory one, absent when there is none.
     Value payload();
     Value inMemoryPayload() const; // never reads the URL
+    // Turns a decoded payload back into its encoded form, what was changed in it included, and lets the tree go; a
+    // payload that was given as a value is encoded too. For a record that has been handled but must be kept: many of
+    // them then stand in memory as bytes. Who still holds the former value holds a tree of its own from then on.
+    void packPayload();
 
     // Only the types, as unsigned numbers.
     std::strong_ordering compare(const CXDChangeRecord& other) const;
@@ -98,7 +102,12 @@ public:
     CXDChangeRecordPtr copy() const;              // shares the payload object; applied-to 0, no delayed payload
 
     CXDChangeRecords splitChangeRecord() const;
+    // Folds `other` into this record's payload and makes this record a composite. kCXInvalidArgumentException, before
+    // anything has changed, when `other` cannot be merged or this record's payload is not a dictionary.
     void mergeWithGroupChangeRecord(CXDChangeRecord& other);
+    // False for what merging refuses: a creation without a name, a distribution-list change without its person or
+    // payload. Such a record stands for itself. May read a delayed payload.
+    bool canBeMerged();
     bool canApplyOutOfOrder() const;
     bool changeMadeByDataOwner() const;
     std::optional<RemoteLocation> remoteLocation(const RecordLocator& locator) const;

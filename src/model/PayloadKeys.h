@@ -1,0 +1,25 @@
+#pragma once
+
+namespace rolvane {
+
+// Keys of a composite group change's payload. The group's new name stands under kCXGroupNameProperty beside them.
+inline constexpr const char* kMemberAdds = "memberAdds";                           // array of identifiers
+inline constexpr const char* kMemberRemoves = "memberRemoves";                     // array of identifiers
+inline constexpr const char* kSubgroupAdds = "subgroupAdds";                       // array of identifiers
+inline constexpr const char* kSubgroupRemoves = "subgroupRemoves";                 // array of identifiers
+inline constexpr const char* kDistributionListAdds = "distributionListAdds";       // identifier to list value
+inline constexpr const char* kDistributionListRemoves = "distributionListRemoves"; // array of identifiers
+
+// Keys of an access-list change's payload: arrays of principals.
+inline constexpr const char* kAdditions = "additions";
+inline constexpr const char* kDeletions = "deletions";
+
+// Keys of a group's state inside a prior or current state. Its name and access lists stand under the property names.
+inline constexpr const char* kMemberUIDState = "memberUIDState";               // array of person identifiers
+inline constexpr const char* kSubgroupUIDState = "subgroupUIDState";           // array of group identifiers
+inline constexpr const char* kDistributionListState = "distributionListState"; // person identifier to list value
+
+// Where a conduit's prior state stands in its data: user to group identifier to group state.
+inline constexpr const char* kPriorState = "priorState";
+
+} // namespace rolvane
