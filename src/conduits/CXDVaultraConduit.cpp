@@ -1,0 +1,273 @@
+#include "conduits/CXDVaultraConduit.h"
+
+#include "conduits/LocalizedText.h"
+#include "conduits/PublishedLayout.h"
+#include "conduits/UserAlert.h"
+#include "foundation/Log.h"
+#include "foundation/Preferences.h"
+#include "foundation/PropertyList.h"
+#include "store/CXDAVManager.h"
+#include "store/CXNetworkController.h"
+
+namespace rolvane {
+namespace {
+
+constexpr int kForbidden = 403;
+
+using ACLChange = void (CXACLManager::*)(const UniqueId&, const std::vector<UniqueId>&, const UserName&);
+
+void changeACL(CXACLManager& manager, CXDChangeRecord& record, const std::vector<UniqueId>& members, ACLChange grant,
+               ACLChange deny) {
+    const Dictionary differences = record.payload().dictionary();
+    const UniqueId group = record.group().value_or(UniqueId());
+    for (const Value& principal : differences["additions"].array())
+        (manager.*grant)(group, members, UserName(principal.string()));
+    for (const Value& principal : differences["deletions"].array())
+        (manager.*deny)(group, members, UserName(principal.string()));
+}
+
+// What the store is known to hold as members of the record's group in that user's tree.
+std::vector<UniqueId> knownMembers(ConduitEngine& engine, const std::optional<UserName>& user,
+                                   const CXDChangeRecord& record) {
+    if (!user || !record.group()) return {};
+    const Dictionary state = engine.conduitObjectForKey(kConduitVaultra, "priorState");
+    const Dictionary group = state[user->str()].dictionary()[record.group()->str()].dictionary();
+    std::vector<UniqueId> members;
+    for (const Value& member : group[layout::kMembers].array()) members.emplace_back(member.string());
+    return members;
+}
+
+} // namespace
+
+std::shared_ptr<CXACLManager> makePlainACLManager(const Url& baseLocation, const LocationOwner& owner) {
+    return std::make_shared<CXACLManager>(baseLocation, owner);
+}
+
+CXDVaultraConduit::CXDVaultraConduit(ConduitEngine& engine, World world)
+    : CXDConduit(engine), _world(std::move(world)) {
+    _simulated = _world.distributed.observe(
+        "SimulateVaultraNotification", [this](const Notification&) { vaultraSynced(); }, true);
+    _networkChanged = _world.notifications.observe(kCXNetworkConfigurationDidChangeNotification,
+                                                   [this](const Notification&) { networkChanged(); });
+}
+
+CXDVaultraConduit::~CXDVaultraConduit() = default;
+
+std::optional<std::string> CXDVaultraConduit::conduitID() const {
+    return kConduitVaultra;
+}
+
+std::optional<UserName> CXDVaultraConduit::realUserFromUser(const std::optional<UserName>& user) const {
+    return user == kSelf ? _world.manager.account().user : user;
+}
+
+int32_t CXDVaultraConduit::conduitSource() const {
+    return CXDSyncSourceVaultra;
+}
+
+CXFileManager* CXDVaultraConduit::defaultManager() const {
+    return &_world.manager;
+}
+
+std::optional<Url> CXDVaultraConduit::baseLocationForUser(const std::optional<UserName>& user) const {
+    if (!user) return std::nullopt;
+    return _world.manager.account().baseLocationFor(*user);
+}
+
+std::optional<Url> CXDVaultraConduit::baseLocationOf(const CXDChangeRecord& record) const {
+    return baseLocationForUser(realUserFromUser(record.user()));
+}
+
+// -- reachability and the pass's frame
+
+int CXDVaultraConduit::testReachability() {
+    CXDAVError error;
+    const auto address = Url::parse(_world.manager.account().endpointOrigin());
+    // Without a route nobody is asked, so nobody can refuse the password either.
+    const bool online =
+        _world.network.canReachAddress(address ? address->host() : "") && _world.manager.canReach(error);
+    _vaultraOffLine = !online;
+    CXDLog("Vaultra is %@", online ? "online" : "offline");
+    return error.code;
+}
+
+void CXDVaultraConduit::open() {
+    if (testReachability() == kCXDAVErrorAuthentication) {
+        if (shouldWarnUserAboutUserNameOrPassword()) {
+            CXDLog("Username or password is incorrect. Displaying visual warning");
+            warnUserAboutUserNameOrPassword();
+        } else {
+            CXDLog("Username or password is incorrect. No visual warning");
+        }
+        engine().cancel();
+    }
+    _lastSyncDate = _world.preferences.get(kDaemonDomain, kLastSyncDateKey).date().value_or(Date::distantPast());
+    if (!_vaultraOffLine) sanityCheckPublishStructure();
+}
+
+void CXDVaultraConduit::close() {
+    CXDConduit::close();
+    if (_vaultraOffLine) return;
+    const std::optional<Date> now = currentServerDate();
+    CXDLog("Closing, last sync: %@", now);
+    // A store that went away during the pass tells no date: keeping the old one costs reads, a guessed one loses edits.
+    if (!now) return;
+    _lastSyncDate = now;
+    _world.preferences.set(kDaemonDomain, kLastSyncDateKey, *now);
+    _world.preferences.synchronize(kDaemonDomain);
+}
+
+std::optional<Date> CXDVaultraConduit::currentServerDate() {
+    const auto base = baseLocationForUser(realUserFromUser(kSelf));
+    if (!base) return std::nullopt;
+    const Url dateFile = layout::dateFileLocation(*base);
+    _world.manager.write(std::string(layout::kClockText), dateFile, false);
+    return _world.manager.modDateForURL(dateFile);
+}
+
+bool CXDVaultraConduit::sanityCheckPublishStructure() {
+    return _world.manager.sanityCheckPublishStructureCreate(true);
+}
+
+void CXDVaultraConduit::networkChanged() {
+    CXDLog("Network changed");
+    testReachability();
+    if (!_vaultraOffLine) engine().bringSourcesUpToDate();
+}
+
+void CXDVaultraConduit::vaultraSynced() {
+    engine().bringSourcesUpToDate();
+}
+
+bool CXDVaultraConduit::shouldWarnUserAboutUserNameOrPassword() const {
+    const auto last = _world.preferences.get(kDaemonDomain, kLastWarningDateKey).date();
+    return !last || _world.clock.now().secondsSince(*last) > kWarningInterval;
+}
+
+void CXDVaultraConduit::warnUserAboutUserNameOrPassword() {
+    UserAlert::Text text;
+    text.header = localizedText("SHARING_BAD_USERNAME_PASS_HEADER");
+    text.message = localizedText("SHARING_BAD_USERNAME_PASS");
+    text.defaultButton = localizedText("OK");
+    text.icon = "Rolvane";
+    _world.alert.show(text);
+    _world.preferences.set(kDaemonDomain, kLastWarningDateKey, _world.clock.now());
+    _world.preferences.synchronize(kDaemonDomain);
+}
+
+// -- applying
+
+bool CXDVaultraConduit::lockStructureForRecord(const CXDChangeRecord& record) {
+    const auto base = baseLocationOf(record);
+    return base && engine().lockURL(layout::dateFileLocation(*base));
+}
+
+bool CXDVaultraConduit::applyChangeRecord(const CXDChangeRecordPtr& record, bool* denied) {
+    if (denied) *denied = false;
+    if (_vaultraOffLine || !lockStructureForRecord(*record)) return false;
+    int code = 0;
+    const bool applied = apply(*record, code);
+    if (denied) *denied = code == kForbidden;
+    return applied;
+}
+
+bool CXDVaultraConduit::apply(CXDChangeRecord& record, int& code) {
+    switch (record.type()) {
+    case CXDUpdateRecord: return updateRecord(record, code);
+    case CXDCreateStructureForGroup: return createStructureForGroup(record, code);
+    case CXDCompositeGroupChange: return makeCompositeGroupChange(record, code);
+    case CXDChangeGroupName: return changeGroupName(record, code);
+    case CXDAddRecordToGroup: return addRecordToGroup(record, code);
+    case CXDChangeGroupReadACL: return changeGroupReadACL(record);
+    case CXDChangeGroupReadWriteACL: return changeGroupReadWriteACL(record);
+    case CXDRemoveRecordFromGroup: return true; // markers stay on the network store
+    case CXDDeleteRecord: return deleteRecord(record, code);
+    case CXDDeleteGroup: return deleteGroup(record, code);
+    default: return false;
+    }
+}
+
+bool CXDVaultraConduit::updateRecord(CXDChangeRecord& record, int& code) {
+    const auto base = baseLocationOf(record);
+    if (!base || !record.person()) return false;
+    return _world.manager.write(stringForDictionary(record.payload().dictionary()),
+                                layout::contactLocation(*base, *record.person()), kSecureRecordWrites, &code);
+}
+
+bool CXDVaultraConduit::createStructureForGroup(CXDChangeRecord& record, int& code) {
+    const auto base = baseLocationOf(record);
+    if (!base || !record.group()) return false;
+    // Whether the directory could be made shows in the write below it.
+    _world.manager.createDirectoryAtAURL(layout::groupLocation(*base, *record.group()));
+    return _world.manager.write(stringForDictionary(record.payload().dictionary()),
+                                layout::groupInfoLocation(*base, *record.group()), kSecureRecordWrites, &code);
+}
+
+bool CXDVaultraConduit::makeCompositeGroupChange(CXDChangeRecord& record, int& code) {
+    const auto base = baseLocationOf(record);
+    if (!base || !record.group()) return false;
+    const Url location = layout::groupLocation(*base, *record.group());
+    const auto state = _world.manager.dictionaryAtURL(location, false, &code);
+    // When the state was there but could not be read, the client refuses the write: it is not the state that was read.
+    const Dictionary changed =
+        layout::groupStateAfterComposite(state.value_or(Dictionary()), record.payload().dictionary());
+    return _world.manager.write(stringForDictionary(changed), location, kSecureRecordWrites, &code);
+}
+
+bool CXDVaultraConduit::changeGroupName(CXDChangeRecord& record, int& code) {
+    const auto base = baseLocationOf(record);
+    if (!base || !record.group()) return false;
+    return _world.manager.write(stringForDictionary(layout::infoAfterRename(record.payload())),
+                                layout::groupInfoLocation(*base, *record.group()), false, &code);
+}
+
+bool CXDVaultraConduit::addRecordToGroup(CXDChangeRecord& record, int& code) {
+    const auto base = baseLocationOf(record);
+    if (!base || !record.group() || !record.person()) return false;
+    return _world.manager.write(std::string(layout::kMemberMarkerText),
+                                layout::memberMarkerLocation(*base, *record.group(), *record.person()), false, &code);
+}
+
+bool CXDVaultraConduit::deleteRecord(CXDChangeRecord& record, int& code) {
+    const auto base = baseLocationOf(record);
+    if (!base || !record.person()) return false;
+    return _world.manager.removeFileAtURL(layout::contactLocation(*base, *record.person()), &code);
+}
+
+bool CXDVaultraConduit::deleteGroup(CXDChangeRecord& record, int& code) {
+    const auto base = baseLocationOf(record);
+    if (!base || !record.group()) return false;
+    return _world.manager.removeFileAtURL(layout::groupLocation(*base, *record.group()), &code);
+}
+
+// -- access lists; they reach the store when the managers are saved at the end of the pass
+
+// The read change looks the members up under the account's name, the read-write change under the record's own user.
+bool CXDVaultraConduit::changeGroupReadACL(CXDChangeRecord& record) {
+    const auto base = baseLocationOf(record);
+    const auto manager = base ? ACLManagerForRemoteLocation(*base) : nullptr;
+    if (manager)
+        changeACL(*manager, record, knownMembers(engine(), realUserFromUser(record.user()), record),
+                  &CXACLManager::grantReadPermissionForGUID, &CXACLManager::denyReadPermissionForGUID);
+    return true;
+}
+
+bool CXDVaultraConduit::changeGroupReadWriteACL(CXDChangeRecord& record) {
+    const auto base = baseLocationOf(record);
+    const auto manager = base ? ACLManagerForRemoteLocation(*base) : nullptr;
+    if (manager)
+        changeACL(*manager, record, knownMembers(engine(), record.user(), record),
+                  &CXACLManager::grantReadWritePermissionForGUID, &CXACLManager::denyReadWritePermissionForGUID);
+    return true;
+}
+
+std::shared_ptr<CXACLManager> CXDVaultraConduit::ACLManagerForRemoteLocation(const Url& location) {
+    if (auto known = CXDConduit::ACLManagerForRemoteLocation(location)) return known;
+    const auto base = baseLocationForRemoteLocation(location);
+    if (!base) return nullptr;
+    auto manager = _world.makeACLManager(*base, engine());
+    _ACLManagerMap->insert_or_assign(base->absoluteString(), manager);
+    return manager;
+}
+
+} // namespace rolvane

@@ -1,0 +1,103 @@
+#pragma once
+
+#include "conduits/CXDConduit.h"
+#include "foundation/Notification.h"
+
+#include <atomic>
+#include <functional>
+#include <memory>
+#include <string>
+
+namespace rolvane {
+
+class CXDAVManager;
+class CXNetworkController;
+class Clock;
+class Preferences;
+class UserAlert;
+
+// Makes the access-list manager of a base location. Exists so that the store that keeps the lists can be replaced.
+using ACLManagerFactory =
+    std::function<std::shared_ptr<CXACLManager>(const Url& baseLocation, const LocationOwner& owner)>;
+
+// A manager that keeps its lists in memory only: nothing is loaded from or saved to any store.
+std::shared_ptr<CXACLManager> makePlainACLManager(const Url& baseLocation, const LocationOwner& owner);
+
+// The conduit of the network store: applies change records to the tree of the record's user on the WebDAV store, and
+// knows whether the store can be used at all.
+//
+// Threads: workers call applyChangeRecordIfNeeded side by side for records other than access-list changes; everything
+// else, access-list changes included, comes on the main thread while no worker runs.
+class CXDVaultraConduit : public CXDConduit {
+public:
+    static constexpr const char* kLastSyncDateKey = "CXDVaultraConduitLastSyncDate";
+    static constexpr const char* kLastWarningDateKey = "CXDLastUserPasswordWarningDate";
+    static constexpr double kWarningInterval = 900;   // seconds between two password warnings
+    static constexpr bool kSecureRecordWrites = true; // contact records, group states and new groups' "info"
+
+    // All borrowed; they outlive the conduit.
+    struct World {
+        CXDAVManager& manager;
+        CXNetworkController& network;
+        Preferences& preferences;
+        Clock& clock;
+        NotificationCenter& notifications;     // this process's: the network's changes
+        DistributedNotifications& distributed; // the user's processes': "SimulateVaultraNotification"
+        UserAlert& alert;
+        ACLManagerFactory makeACLManager = makePlainACLManager;
+    };
+
+    CXDVaultraConduit(ConduitEngine& engine, World world);
+    ~CXDVaultraConduit() override;
+
+    std::optional<std::string> conduitID() const override;
+    // "<self>" is the account's user; any other user stays.
+    std::optional<UserName> realUserFromUser(const std::optional<UserName>& user) const override;
+    int32_t conduitSource() const override;
+    CXFileManager* defaultManager() const override;
+    std::optional<Url> baseLocationForUser(const std::optional<UserName>& user) const override;
+    // False: the change was not made and stays pending; *denied: the store refused it with 403. Off line, and without
+    // the lock of the tree, nothing is sent.
+    using CXDConduit::applyChangeRecord;
+    bool applyChangeRecord(const CXDChangeRecordPtr& record, bool* denied) override;
+    // A refused user name or password warns the person, at most once in 15 minutes, and ends the daemon.
+    void open() override;
+    // The stored last-sync date moves to the server's date; off line, or when the server does not tell it, it stays.
+    void close() override;
+    // The map's manager, else a new one for the location's base location, which the map then keeps. None when the
+    // location has no base location.
+    std::shared_ptr<CXACLManager> ACLManagerForRemoteLocation(const Url& location) override;
+
+    bool vaultraOffLine() const { return _vaultraOffLine; }
+    // Touches the owner's clock file and asks for its date; nothing when the store does not answer.
+    std::optional<Date> currentServerDate();
+    bool sanityCheckPublishStructure();
+    bool lockStructureForRecord(const CXDChangeRecord& record); // any thread
+
+    void networkChanged();
+    void vaultraSynced();
+    bool shouldWarnUserAboutUserNameOrPassword() const;
+    void warnUserAboutUserNameOrPassword();
+
+private:
+    int testReachability(); // sets _vaultraOffLine; the error's code, 0 when there was none
+    std::optional<Url> baseLocationOf(const CXDChangeRecord& record) const;
+
+    // Each writes one kind of change and sets the result code to the last request's HTTP status.
+    bool apply(CXDChangeRecord& record, int& code);
+    bool updateRecord(CXDChangeRecord& record, int& code);
+    bool createStructureForGroup(CXDChangeRecord& record, int& code);
+    bool makeCompositeGroupChange(CXDChangeRecord& record, int& code);
+    bool changeGroupName(CXDChangeRecord& record, int& code);
+    bool addRecordToGroup(CXDChangeRecord& record, int& code);
+    bool deleteRecord(CXDChangeRecord& record, int& code);
+    bool deleteGroup(CXDChangeRecord& record, int& code);
+    bool changeGroupReadACL(CXDChangeRecord& record);
+    bool changeGroupReadWriteACL(CXDChangeRecord& record);
+
+    World _world;
+    std::atomic<bool> _vaultraOffLine = false;
+    ObservationHandle _simulated, _networkChanged;
+};
+
+} // namespace rolvane

@@ -1,0 +1,65 @@
+#include "conduits/PublishedLayout.h"
+
+#include "acl/CXACLManager.h"
+#include "contacts/Constants.h"
+
+namespace rolvane::layout {
+namespace {
+
+void appendMissing(Array& list, const Array& additions) {
+    for (const Value& added : additions)
+        if (!list.contains(added)) list.append(added);
+}
+
+void updateList(Dictionary& state, const char* key, const Array& additions, const Array& removals) {
+    Array list = state.arrayFor(key);
+    appendMissing(list, additions);
+    list.removeAllOf(removals);
+}
+
+} // namespace
+
+Url contactLocation(const Url& base, const UniqueId& person) {
+    return base.cxURLByAppendingComponent(kPeople)
+        .cxURLByAppendingComponent(CXACLManager::bucketNameForUID(person))
+        .cxURLByAppendingComponent(person.str());
+}
+
+Url groupLocation(const Url& base, const UniqueId& group) {
+    return base.cxURLByAppendingComponent(group.str());
+}
+
+Url groupInfoLocation(const Url& base, const UniqueId& group) {
+    return groupLocation(base, group).cxURLByAppendingComponent(kInfo);
+}
+
+Url memberMarkerLocation(const Url& base, const UniqueId& group, const UniqueId& person) {
+    return groupLocation(base, group).cxURLByAppendingComponent(person.str());
+}
+
+Url dateFileLocation(const Url& base) {
+    return base.cxURLByAppendingComponent(kDateFile);
+}
+
+bool isASpecialFile(std::string_view name) {
+    return name == kDateFile || name == kInfo || name == kContacts;
+}
+
+Dictionary groupStateAfterComposite(const Dictionary& state, const Dictionary& payload) {
+    Dictionary after = Value(state).deepMutableCopy().dictionary();
+    updateList(after, kMembers, payload[kMemberAdds].array(), payload[kMemberRemoves].array());
+    updateList(after, kSubgroups, payload[kSubgroupAdds].array(), payload[kSubgroupRemoves].array());
+    if (const Value& name = payload[kCXGroupNameProperty]) after.set(kCXGroupNameProperty, name);
+    Dictionary lists = after.dictionaryFor(kDistributionLists);
+    lists.addEntriesFrom(payload[kDistributionListAdds].dictionary());
+    for (const Value& person : payload[kDistributionListRemoves].array()) lists.remove(person.string());
+    return after;
+}
+
+Dictionary infoAfterRename(const Value& name) {
+    Dictionary info;
+    if (name) info.set(kCXGroupNameProperty, name);
+    return info;
+}
+
+} // namespace rolvane::layout
