@@ -6,6 +6,7 @@
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
 #include "foundation/PropertyList.h"
+#include "model/PayloadKeys.h"
 
 namespace rolvane {
 
@@ -41,14 +42,14 @@ void CXDConduit::open() {}
 void CXDConduit::close() {
     const auto identifier = conduitID();
     if (!identifier) return;
-    Dictionary prior = _engine.conduitObjectForKey(*identifier, "priorState");
+    Dictionary prior = _engine.conduitObjectForKey(*identifier, kPriorState);
     for (const RemoteLocation& location : _engine.revokedRemoteLocations())
         prior.remove(_engine.userForRemoteLocation(location).str());
 }
 
 CXDChangeRecords CXDConduit::changeRecords() {
     const auto identifier = conduitID();
-    const Dictionary prior = identifier ? _engine.conduitObjectForKey(*identifier, "priorState") : Dictionary();
+    const Dictionary prior = identifier ? _engine.conduitObjectForKey(*identifier, kPriorState) : Dictionary();
     return comparePriorStateToCurrentState(prior, currentState());
 }
 

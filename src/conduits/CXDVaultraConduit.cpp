@@ -5,7 +5,8 @@
 #include "conduits/UserAlert.h"
 #include "foundation/Log.h"
 #include "foundation/Preferences.h"
-#include "foundation/PropertyList.h"
+#include "model/PayloadKeys.h"
+#include "model/RemoteLocationMap.h"
 #include "store/CXDAVManager.h"
 #include "store/CXNetworkController.h"
 
@@ -20,9 +21,9 @@ void changeACL(CXACLManager& manager, CXDChangeRecord& record, const std::vector
                ACLChange deny) {
     const Dictionary differences = record.payload().dictionary();
     const UniqueId group = record.group().value_or(UniqueId());
-    for (const Value& principal : differences["additions"].array())
+    for (const Value& principal : differences[kAdditions].array())
         (manager.*grant)(group, members, UserName(principal.string()));
-    for (const Value& principal : differences["deletions"].array())
+    for (const Value& principal : differences[kDeletions].array())
         (manager.*deny)(group, members, UserName(principal.string()));
 }
 
@@ -30,10 +31,10 @@ void changeACL(CXACLManager& manager, CXDChangeRecord& record, const std::vector
 std::vector<UniqueId> knownMembers(ConduitEngine& engine, const std::optional<UserName>& user,
                                    const CXDChangeRecord& record) {
     if (!user || !record.group()) return {};
-    const Dictionary state = engine.conduitObjectForKey(kConduitVaultra, "priorState");
+    const Dictionary state = engine.conduitObjectForKey(kConduitVaultra, kPriorState);
     const Dictionary group = state[user->str()].dictionary()[record.group()->str()].dictionary();
     std::vector<UniqueId> members;
-    for (const Value& member : group[layout::kMembers].array()) members.emplace_back(member.string());
+    for (const Value& member : group[kMemberUIDState].array()) members.emplace_back(member.string());
     return members;
 }
 

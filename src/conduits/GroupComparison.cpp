@@ -2,6 +2,7 @@
 
 #include "conduits/PublishedLayout.h"
 #include "contacts/Constants.h"
+#include "model/PayloadKeys.h"
 
 namespace rolvane {
 namespace {
@@ -21,13 +22,13 @@ public:
     }
 
     void members() {
-        const Dictionary differences = differencesOf(layout::kMembers);
-        for (const Value& added : differences["additions"].array()) {
+        const Dictionary differences = differencesOf(kMemberUIDState);
+        for (const Value& added : differences[kAdditions].array()) {
             const UniqueId member(added.string());
             _steps.push_back(CaptureMember{member});
             add(CXDAddRecordToGroup, member, _address.guid);
         }
-        for (const Value& removed : differences["deletions"].array()) {
+        for (const Value& removed : differences[kDeletions].array()) {
             const UniqueId member(removed.string());
             // Whoever leaves the all-contacts group has left the database.
             if (_isAllGroup) add(CXDDeleteRecord, member, {});
@@ -37,13 +38,13 @@ public:
     }
 
     void subgroups() {
-        const Dictionary differences = differencesOf(layout::kSubgroups);
-        for (const Value& added : differences["additions"].array()) {
+        const Dictionary differences = differencesOf(kSubgroupUIDState);
+        for (const Value& added : differences[kAdditions].array()) {
             const UniqueId subgroup(added.string());
             _steps.push_back(CaptureSubgroup{subgroup});
             add(CXDAddGroupToGroup, subgroup, _address.guid);
         }
-        for (const Value& removed : differences["deletions"].array()) {
+        for (const Value& removed : differences[kDeletions].array()) {
             const UniqueId subgroup(removed.string());
             if (_isAllGroup) add(CXDDeleteGroup, {}, subgroup);
             add(CXDRemoveGroupFromGroup, subgroup, _address.guid);
@@ -64,8 +65,8 @@ public:
 
     void distributionLists() {
         if (_isAllGroup) return;
-        for (auto& record : compareDistributionStates(_prior[layout::kDistributionLists].dictionary(),
-                                                      _current[layout::kDistributionLists].dictionary(), _address))
+        for (auto& record : compareDistributionStates(_prior[kDistributionListState].dictionary(),
+                                                      _current[kDistributionListState].dictionary(), _address))
             _steps.push_back(std::move(record));
     }
 
@@ -78,7 +79,7 @@ private:
 
     void accessList(CXDChangeType type, const char* property) {
         const Dictionary differences = differencesOf(property);
-        if (!differences["additions"].array().empty() || !differences["deletions"].array().empty())
+        if (!differences[kAdditions].array().empty() || !differences[kDeletions].array().empty())
             add(type, {}, _address.guid, differences);
     }
 

@@ -2,6 +2,7 @@
 
 #include "acl/CXACLManager.h"
 #include "contacts/Constants.h"
+#include "model/PayloadKeys.h"
 
 namespace rolvane::layout {
 namespace {
@@ -47,10 +48,10 @@ bool isASpecialFile(std::string_view name) {
 
 Dictionary groupStateAfterComposite(const Dictionary& state, const Dictionary& payload) {
     Dictionary after = Value(state).deepMutableCopy().dictionary();
-    updateList(after, kMembers, payload[kMemberAdds].array(), payload[kMemberRemoves].array());
-    updateList(after, kSubgroups, payload[kSubgroupAdds].array(), payload[kSubgroupRemoves].array());
+    updateList(after, kMemberUIDState, payload[kMemberAdds].array(), payload[kMemberRemoves].array());
+    updateList(after, kSubgroupUIDState, payload[kSubgroupAdds].array(), payload[kSubgroupRemoves].array());
     if (const Value& name = payload[kCXGroupNameProperty]) after.set(kCXGroupNameProperty, name);
-    Dictionary lists = after.dictionaryFor(kDistributionLists);
+    Dictionary lists = after.dictionaryFor(kDistributionListState);
     lists.addEntriesFrom(payload[kDistributionListAdds].dictionary());
     for (const Value& person : payload[kDistributionListRemoves].array()) lists.remove(person.string());
     return after;

@@ -27,19 +27,6 @@ inline constexpr std::string_view kAllGroup = "AllCXGroup";
 inline constexpr std::string_view kMemberMarkerText = "Distribution Lists Go Here";
 inline constexpr std::string_view kClockText = "why";
 
-// Keys of a group's state file.
-inline constexpr const char* kMembers = "memberUIDState";
-inline constexpr const char* kSubgroups = "subgroupUIDState";
-inline constexpr const char* kDistributionLists = "distributionListState";
-
-// Keys of a composite change's payload.
-inline constexpr const char* kMemberAdds = "memberAdds";
-inline constexpr const char* kMemberRemoves = "memberRemoves";
-inline constexpr const char* kSubgroupAdds = "subgroupAdds";
-inline constexpr const char* kSubgroupRemoves = "subgroupRemoves";
-inline constexpr const char* kDistributionListAdds = "distributionListAdds";
-inline constexpr const char* kDistributionListRemoves = "distributionListRemoves";
-
 Url contactLocation(const Url& base, const UniqueId& person);
 Url groupLocation(const Url& base, const UniqueId& group); // state file and directory
 Url groupInfoLocation(const Url& base, const UniqueId& group);
