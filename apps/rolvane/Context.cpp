@@ -1,0 +1,102 @@
+#include "Context.h"
+
+#include <cmath>
+#include <fmt/format.h>
+#include <iostream>
+#include <unistd.h>
+
+namespace rolvane::cli {
+
+struct Context::Impl {
+    RunLoop* loop = nullptr;
+    std::unique_ptr<DistributedNotifications> bus;
+    bool opened = false;
+};
+
+Context::Context() : _impl(std::make_unique<Impl>()) {}
+
+Context::~Context() {
+    if (_impl->opened) CXRolvane::closeShared();
+}
+
+RunLoop& Context::loop() {
+    if (!_impl->loop) _impl->loop = &RunLoop::current();
+    return *_impl->loop;
+}
+
+DistributedNotifications& Context::bus() {
+    if (!_impl->bus) _impl->bus = makeBusNotifications(loop());
+    return *_impl->bus;
+}
+
+CXRolvane& Context::database() {
+    if (!_impl->opened) {
+        CXRolvane::Options options;
+        options.program = "rolvane";
+        options.distributed = &bus();
+        CXRolvane::configureShared(options);
+        _impl->opened = true;
+    }
+    return CXRolvane::sharedRolvane();
+}
+
+void Context::print(const nlohmann::ordered_json& data) {
+    std::cout << data.dump(2, ' ', false, nlohmann::json::error_handler_t::replace) << "\n";
+}
+
+void Context::line(const std::string& text) {
+    std::cout << text << "\n";
+}
+
+void Context::say(const std::string& text) {
+    if (!quiet) std::cerr << text << "\n";
+}
+
+void Context::warn(const std::string& text) {
+    std::cerr << text << "\n";
+}
+bool Context::talkIsTerminal() const {
+    return ::isatty(STDERR_FILENO) == 1;
+}
+bool Context::dataIsTerminal() const {
+    return ::isatty(STDOUT_FILENO) == 1;
+}
+
+ProgressBar::ProgressBar(Context& context, std::string label) : _context(context), _label(std::move(label)) {}
+
+ProgressBar::~ProgressBar() {
+    if (_open) std::cerr << "\n";
+}
+
+void ProgressBar::update(double fraction, const std::string& note) {
+    if (_context.quiet) return;
+    const double clamped = std::isfinite(fraction) ? std::min(1.0, std::max(0.0, fraction)) : 0.0;
+    const int percent = static_cast<int>(clamped * 100);
+    if (_context.talkIsTerminal()) {
+        if (percent == _shown) return;
+        _shown = percent;
+        constexpr int width = 40;
+        const int full = percent * width / 100;
+        std::cerr << fmt::format("\r{} [{}{}] {:3}% {}\033[K", _label, std::string(static_cast<size_t>(full), '#'),
+                                 std::string(static_cast<size_t>(width - full), ' '), percent, note)
+                  << std::flush;
+        _open = true;
+        return;
+    }
+    if (percent / 10 == _shown) return;
+    _shown = percent / 10;
+    std::cerr << fmt::format("{} {}% {}", _label, percent, note) << "\n";
+}
+
+CLI::App* addCommand(CLI::App& parent, Context& context, const std::string& name, const std::string& description,
+                     const std::function<void(CLI::App&)>& declare, std::function<void()> body) {
+    CLI::App* command = parent.add_subcommand(name, description);
+    command->fallthrough();
+    command->add_flag("--json", context.json, "Print data as one JSON document");
+    command->add_flag("-q,--quiet", context.quiet, "No messages but errors");
+    if (declare) declare(*command);
+    command->final_callback(std::move(body));
+    return command;
+}
+
+} // namespace rolvane::cli

@@ -1,0 +1,91 @@
+#pragma once
+
+#include "contacts/CXRolvane.h"
+#include "foundation/CXException.h"
+
+#include <CLI/CLI.hpp>
+#include <functional>
+#include <iosfwd>
+#include <memory>
+#include <nlohmann/json.hpp>
+#include <string>
+
+namespace rolvane::cli {
+
+// Exit codes, the same for every command; `rolvane --help` lists them.
+enum ExitCode : int {
+    kOk = 0,
+    kFailed = 1,      // it could not be done; the message says why
+    kUsage = 2,       // the command line is wrong
+    kNotFound = 3,    // what was named does not exist, or the name fits several
+    kPartly = 4,      // some of the input was taken and some refused; each refusal is named
+    kRefused = 5,     // not allowed: a read-only copy, a wrong password, no right on the store
+    kUnreachable = 6, // the store or the daemon could not be reached in time
+};
+
+// Ends a command with its exit code and a message for standard error: what happened, to what, what to do.
+class CommandError : public CXException {
+public:
+    CommandError(ExitCode code, std::string message) : CXException("CommandError", std::move(message)), _code(code) {}
+    ExitCode code() const { return _code; }
+
+private:
+    ExitCode _code;
+};
+
+// What every command gets: where output goes, and the things that it works on, opened on first use.
+// Data goes to standard output (a table for people, one JSON document with --json); talk goes to standard error.
+class Context {
+public:
+    Context();
+    ~Context();
+
+    bool json = false;  // --json, accepted before and behind the command's name
+    bool quiet = false; // --quiet: no talk but errors
+    int exitCode = kOk; // what the command ends with when nothing is thrown
+
+    CXRolvane& database();           // the user's contact database
+    DistributedNotifications& bus(); // the session bus; posts nothing without one
+    RunLoop& loop();
+
+    void print(const nlohmann::ordered_json& data); // one JSON document and a line end
+    void line(const std::string& text);             // a line of data
+    void say(const std::string& text);              // a line of talk, unless --quiet
+    void warn(const std::string& text);             // a line on standard error, always
+    bool talkIsTerminal() const;                    // standard error is a terminal
+    bool dataIsTerminal() const;
+
+private:
+    struct Impl;
+    std::unique_ptr<Impl> _impl;
+};
+
+// A progress bar on standard error: drawn in place on a terminal, one line at every tenth elsewhere, nothing with
+// --quiet. Ends its line when it is destroyed.
+class ProgressBar {
+public:
+    ProgressBar(Context& context, std::string label);
+    ~ProgressBar();
+    void update(double fraction, const std::string& note = {}); // 0..1
+
+private:
+    Context& _context;
+    std::string _label;
+    int _shown = -1;
+    bool _open = false;
+};
+
+// Adds a command whose body runs after the whole line has been parsed. The body throws or sets context.exitCode.
+CLI::App* addCommand(CLI::App& parent, Context& context, const std::string& name, const std::string& description,
+                     const std::function<void(CLI::App&)>& declare, std::function<void()> body);
+
+// Each file of commands has one of these.
+void addContactCommands(CLI::App& app, Context& context);     // import export list show add edit delete
+void addGroupCommands(CLI::App& app, Context& context);       // group …
+void addAccountCommands(CLI::App& app, Context& context);     // account …
+void addSharingCommands(CLI::App& app, Context& context);     // publish unpublish sync
+void addDaemonCommands(CLI::App& app, Context& context);      // daemon … status watch
+void addPreferencesCommands(CLI::App& app, Context& context); // defaults …
+void addStoreCommands(CLI::App& app, Context& context);       // store …
+
+} // namespace rolvane::cli

@@ -1,0 +1,78 @@
+#include "daemon/CheckIn.h"
+
+#include <cerrno>
+#include <fcntl.h>
+#include <memory>
+#include <sys/eventfd.h>
+#include <sys/socket.h>
+#include <systemd/sd-daemon.h>
+#include <unistd.h>
+
+namespace rolvane {
+
+namespace {
+
+// Reads and forgets what is waiting on a descriptor; never blocks.
+void drain(int fd) {
+    char scratch[4096];
+    for (;;) {
+        const ssize_t n = ::read(fd, scratch, sizeof scratch);
+        if (n > 0 || (n < 0 && errno == EINTR)) continue;
+        return;
+    }
+}
+
+// A message on demand: its only meaning is that the daemon is wanted, and it runs already.
+void drainListeningSocket(int fd) {
+    for (;;) {
+        const int peer = ::accept4(fd, nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK);
+        if (peer < 0) {
+            if (errno == EINTR || errno == ECONNABORTED) continue;
+            return;
+        }
+        drain(peer);
+        ::close(peer);
+    }
+}
+
+void makeNonBlocking(int fd) {
+    const int flags = ::fcntl(fd, F_GETFL);
+    if (flags >= 0) ::fcntl(fd, F_SETFL, flags | O_NONBLOCK);
+}
+
+} // namespace
+
+CheckInPorts::CheckInPorts(CheckInPorts&& other) noexcept
+    : _sources(std::move(other._sources)), _idle(std::exchange(other._idle, -1)), _fromLauncher(other._fromLauncher) {}
+
+CheckInPorts::~CheckInPorts() {
+    _sources.clear();
+    if (_idle >= 0) ::close(_idle);
+}
+
+CheckInPorts CXDCheckIn(RunLoop& loop) {
+    CheckInPorts ports;
+    const int passed = sd_listen_fds(1);
+    for (int i = 0; i < passed; ++i) {
+        const int fd = SD_LISTEN_FDS_START + i;
+        const bool listening = sd_is_socket(fd, AF_UNSPEC, SOCK_STREAM, 1) > 0;
+        if (!listening && sd_is_socket(fd, AF_UNSPEC, 0, -1) <= 0 && sd_is_fifo(fd, nullptr) <= 0) continue;
+        makeNonBlocking(fd);
+        ports._sources.push_back(loop.addPort(fd, [fd, listening](uint32_t) {
+            if (listening)
+                drainListeningSocket(fd);
+            else
+                drain(fd);
+        }));
+        ports._fromLauncher = true;
+    }
+    if (!ports._fromLauncher) {
+        ports._idle = ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
+        if (ports._idle >= 0)
+            ports._sources.push_back(loop.addPort(ports._idle, [fd = ports._idle](uint32_t) { drain(fd); }));
+    }
+    sd_notify(0, "READY=1");
+    return ports;
+}
+
+} // namespace rolvane
