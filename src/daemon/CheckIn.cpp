@@ -7,6 +7,7 @@
 #include <sys/socket.h>
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
+#include <utility>
 
 namespace rolvane {
 
