@@ -1,0 +1,97 @@
+#pragma once
+
+#include <chrono>
+#include <memory>
+#include <optional>
+#include <string>
+#include <sys/types.h>
+#include <vector>
+
+namespace rolvane {
+
+inline constexpr const char* kCXPrivateStoreException = "CXPrivateStoreException";
+
+enum class StoreAuthentication { none, basic, digest };
+
+// How a private store is laid out and run. Equal options for the same state directory give the same store.
+struct PrivateStoreOptions {
+    std::string stateDirectory; // "" = stateDirectory()/store
+    std::string documentRoot;   // "" = <stateDirectory>/root; may be elsewhere, on a tmpfs for instance
+    int port = 0;               // 0 = the one of the last start, else a free one
+    bool tls = true;
+    StoreAuthentication authentication = StoreAuthentication::basic;
+    bool http2 = true;
+    std::vector<std::string> hosts = {"localhost", "127.0.0.1", "::1"}; // names and addresses in the certificate
+
+    int processes = 1;             // at start; grows up to maximumProcesses
+    int maximumProcesses = 4;
+    int threadsPerProcess = 32;
+    int keepAliveSeconds = 60;
+    int maximumKeepAliveRequests = 0; // 0 = no limit
+    std::string logLevel = "warn";    // httpd's LogLevel
+    bool accessLog = false;           // a line a request in logs/access.log
+    std::vector<std::string> extraConfiguration; // lines at the end of the configuration
+
+    bool ownsProcess = false; // the destructor stops the store (tests); else it goes on running
+    std::chrono::seconds certificateLifetime{std::chrono::hours(24 * 365 * 5)};
+    std::string httpdProgram = "/usr/sbin/apache2";
+    std::string httpdModules = "/usr/lib/apache2/modules";
+};
+
+struct PrivateStoreStatus {
+    bool running = false;
+    pid_t pid = 0; // 0 when not running
+    int port = 0;  // 0 when the store has never been started
+};
+
+// A private WebDAV store: an unprivileged httpd on the loopback addresses with its own certificate authority, users and
+// lock database below one state directory. It serves <documentRoot>/dav as /dav; every user has the tree /dav/<user>
+// alone: nobody else reads or writes there, and nothing outside these trees is served.
+//
+// Started by root, httpd runs as www-data (else nobody); where that user cannot reach the state directory or document
+// root, it keeps the right to search and read past file modes, and no other.
+//
+// Any process may hold a PrivateStore on a directory that another one started: all state is in the directory, and an
+// advisory lock keeps launchers apart. One object belongs to one thread. Every operation throws
+// kCXPrivateStoreException, whose reason says what to do, with httpd's own words where it has some.
+class PrivateStore {
+public:
+    explicit PrivateStore(PrivateStoreOptions options = {});
+    ~PrivateStore(); // stops only what it owns
+    PrivateStore(PrivateStore&&) noexcept;
+    PrivateStore& operator=(PrivateStore&&) = delete;
+
+    // The options of the last start in that directory ("" = the default one); nothing when there was none.
+    static std::optional<PrivateStoreOptions> savedOptions(const std::string& stateDirectory = "");
+
+    // Returns when the store answers. A running store is left alone. A port that was chosen once is kept; one that
+    // another program holds is an error, not a reason to move, as clients know the store by it.
+    void start();
+
+    enum class Stop { gracefully, atOnce };
+    // Returns when the process is gone; requests under way are finished first if asked. Nothing when not running.
+    void stop(Stop how = Stop::atOnce);
+
+    PrivateStoreStatus status() const;
+
+    // Makes the user and the empty tree, or gives an existing user a new password. A running store is restarted when
+    // the set of users changes. Names: letters, digits and . _ - @ +, at most 64, the first a letter, digit or '_'.
+    void addUser(const std::string& user, const std::string& password);
+    // Takes the account away; the user's files stay. False when there is no such user.
+    bool removeUser(const std::string& user);
+    std::vector<std::string> users() const; // ascending
+
+    std::string stateDirectory() const;
+    std::string documentRoot() const;
+    std::string userDirectory(const std::string& user) const; // where the files of /dav/<user> are
+    std::string caFile() const;                               // PEM, what a client has to trust; made by start()
+    std::string errorLog() const;
+    std::string baseURL() const;          // "https://localhost:PORT/dav"; throws before the first start
+    std::string endpointTemplate() const; // baseURL() + "/{user}/Contacts"
+
+private:
+    struct Implementation;
+    std::unique_ptr<Implementation> _implementation;
+};
+
+} // namespace rolvane

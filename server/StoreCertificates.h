@@ -1,0 +1,32 @@
+#pragma once
+
+#include <chrono>
+#include <string>
+#include <vector>
+
+namespace rolvane {
+
+// The store's own certificate authority and server certificate (EC P-256), as PEM files in one directory:
+//   ca.pem (0644) what clients trust, server.pem the server's certificate, server.key (0600) its key.
+// The authority's key signs one certificate and is never written anywhere, so nobody can sign another one with it; a
+// renewal therefore makes a new authority, too.
+class StoreCertificates {
+public:
+    explicit StoreCertificates(std::string directory) : _directory(std::move(directory)) {}
+
+    // Makes them when they are missing, unreadable, for other hosts (names or addresses), or within a tenth of their
+    // lifetime (at most 30 days) of their end. True when it made them. CXException on failure.
+    bool ensure(const std::vector<std::string>& hosts, std::chrono::seconds lifetime);
+
+    std::string caFile() const { return _directory + "/ca.pem"; }
+    std::string certificateFile() const { return _directory + "/server.pem"; }
+    std::string keyFile() const { return _directory + "/server.key"; }
+
+private:
+    bool areGoodFor(const std::vector<std::string>& hosts, std::chrono::seconds lifetime) const;
+    void make(const std::vector<std::string>& hosts, std::chrono::seconds lifetime);
+
+    std::string _directory;
+};
+
+} // namespace rolvane

@@ -1,0 +1,185 @@
+#include "server/StoreProcess.h"
+
+#include "foundation/CXException.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <csignal>
+#include <cstring>
+#include <fcntl.h>
+#include <filesystem>
+#include <fstream>
+#include <grp.h>
+#include <iterator>
+#include <linux/capability.h>
+#include <poll.h>
+#include <pwd.h>
+#include <sys/prctl.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+namespace rolvane {
+
+namespace {
+
+[[noreturn]] void fail(const std::string& reason) { throw CXException("CXPrivateStoreException", reason); }
+
+// What follows runs between fork and exec: system calls only.
+
+bool inBoundingSet(int capability) { return prctl(PR_CAPBSET_READ, capability, 0, 0, 0) == 1; }
+
+bool keepCapability(int capability) {
+    __user_cap_header_struct header{_LINUX_CAPABILITY_VERSION_3, 0};
+    __user_cap_data_struct data[2] = {};
+    data[0].effective = data[0].permitted = data[0].inheritable = 1u << capability;
+    return syscall(SYS_capset, &header, data) == 0 && prctl(PR_CAP_AMBIENT, PR_CAP_AMBIENT_RAISE, capability, 0, 0) == 0;
+}
+
+bool becomeIdentity(const StoreIdentity& identity) {
+    if (!identity.change) return true;
+    if (identity.passFileModes && prctl(PR_SET_KEEPCAPS, 1, 0, 0, 0) != 0) return false;
+    if (setgroups(0, nullptr) != 0 || setresgid(identity.gid, identity.gid, identity.gid) != 0 ||
+        setresuid(identity.uid, identity.uid, identity.uid) != 0)
+        return false;
+    if (!identity.passFileModes) return true;
+    // Containers often withhold the narrower right.
+    return keepCapability(inBoundingSet(CAP_DAC_READ_SEARCH) ? CAP_DAC_READ_SEARCH : CAP_DAC_OVERRIDE);
+}
+
+[[noreturn]] void runChild(char* const* arguments, const StoreIdentity& identity, int output, int report) {
+    setsid();
+    umask(0077);
+    sigset_t none;
+    sigemptyset(&none);
+    sigprocmask(SIG_SETMASK, &none, nullptr);
+    for (int number : {SIGPIPE, SIGHUP, SIGINT, SIGTERM, SIGCHLD, SIGUSR1}) ::signal(number, SIG_DFL);
+    const int null = open("/dev/null", O_RDONLY);
+    dup2(null, 0);
+    dup2(output, 1);
+    dup2(output, 2);
+    if (report != 3) dup2(report, 3);
+    close_range(4, ~0u, 0);
+    fcntl(3, F_SETFD, FD_CLOEXEC);
+    if (becomeIdentity(identity) && chdir("/") == 0) execv(arguments[0], arguments);
+    const int error = errno;
+    [[maybe_unused]] const ssize_t written = write(3, &error, sizeof error);
+    _exit(127);
+}
+
+FileHandle pidHandle(pid_t pid) { return FileHandle(static_cast<int>(syscall(SYS_pidfd_open, pid, 0))); }
+
+std::string commandLine(pid_t pid) {
+    std::ifstream file("/proc/" + std::to_string(pid) + "/cmdline", std::ios::binary);
+    std::string text(std::istreambuf_iterator<char>(file), {});
+    return text;
+}
+
+} // namespace
+
+FileHandle::~FileHandle() {
+    if (_fd >= 0) close(_fd);
+}
+
+StoreIdentity StoreIdentity::choose() {
+    StoreIdentity identity;
+    identity.uid = geteuid();
+    identity.gid = getegid();
+    if (identity.uid != 0) return identity;
+    for (const char* name : {"www-data", "nobody"}) {
+        if (const passwd* entry = getpwnam(name)) {
+            identity.change = true;
+            identity.uid = entry->pw_uid;
+            identity.gid = entry->pw_gid;
+            identity.name = name;
+            return identity;
+        }
+    }
+    fail("The store's httpd does not run as root, and there is neither a user www-data nor nobody to run it as. Add one "
+         "of them, or start the store as an ordinary user.");
+}
+
+bool StoreIdentity::reaches(const std::string& path) const {
+    if (!change) return true;
+    const auto searchable = [&](const std::filesystem::path& directory) {
+        struct stat info;
+        if (stat(directory.c_str(), &info) != 0) return false;
+        if (info.st_uid == uid) return (info.st_mode & S_IXUSR) != 0;
+        if (info.st_gid == gid) return (info.st_mode & S_IXGRP) != 0;
+        return (info.st_mode & S_IXOTH) != 0;
+    };
+    std::filesystem::path here;
+    for (const auto& component : std::filesystem::path(path)) {
+        here /= component;
+        if (!searchable(here)) return false;
+    }
+    return true;
+}
+
+void StoreIdentity::own(const std::string& path) const {
+    if (change && lchown(path.c_str(), uid, gid) != 0)
+        fail("The store's file " + path + " cannot be given to the user " + name + ": " + std::strerror(errno) + ".");
+}
+
+void StoreIdentity::ownAllIn(const std::string& directory) const {
+    if (!change) return;
+    own(directory);
+    for (const auto& entry : std::filesystem::recursive_directory_iterator(directory)) own(entry.path().string());
+}
+
+std::optional<StoreProcess> StoreProcess::find(pid_t pid, const std::string& configurationFile) {
+    if (pid <= 0) return std::nullopt;
+    FileHandle handle = pidHandle(pid);
+    if (!handle) return std::nullopt;
+    // Opened first, read then: the number cannot change hands between the two without the handle becoming readable.
+    const std::string line = commandLine(pid);
+    StoreProcess process(pid, std::move(handle));
+    const std::string argument = std::string(1, '\0') + configurationFile + '\0';
+    if (line.find(argument) == std::string::npos || process.hasExited()) return std::nullopt;
+    return process;
+}
+
+StoreProcess StoreProcess::launch(const std::vector<std::string>& command, const StoreIdentity& identity,
+                                  const std::string& outputFile) {
+    FileHandle output(open(outputFile.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600));
+    if (!output) fail("The store's file " + outputFile + " cannot be written: " + std::strerror(errno) + ".");
+    int ends[2];
+    if (pipe2(ends, O_CLOEXEC) != 0) fail(std::string("The store cannot be started: ") + std::strerror(errno) + ".");
+    FileHandle reading(ends[0]), writing(ends[1]);
+
+    std::vector<char*> arguments;
+    for (const auto& argument : command) arguments.push_back(const_cast<char*>(argument.c_str()));
+    arguments.push_back(nullptr);
+
+    const pid_t pid = fork();
+    if (pid < 0) fail(std::string("The store cannot be started: ") + std::strerror(errno) + ".");
+    if (pid == 0) runChild(arguments.data(), identity, output.get(), writing.get());
+
+    writing = FileHandle();
+    int error = 0;
+    ssize_t got;
+    while ((got = read(reading.get(), &error, sizeof error)) < 0 && errno == EINTR) {}
+    if (got == sizeof error) {
+        waitpid(pid, nullptr, 0);
+        fail("The store's program " + command.front() + " cannot be run" +
+             (identity.change ? " as the user " + identity.name : std::string()) + ": " + std::strerror(error) + ".");
+    }
+    return StoreProcess(pid, pidHandle(pid));
+}
+
+bool StoreProcess::waitForExit(std::chrono::milliseconds timeout) const {
+    const auto deadline = std::chrono::steady_clock::now() + timeout;
+    for (;;) {
+        const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
+        pollfd descriptor{_handle.get(), POLLIN, 0};
+        const int ready = poll(&descriptor, 1, static_cast<int>(std::max<long>(left.count(), 0)));
+        if (ready < 0 && errno == EINTR) continue;
+        if (ready > 0) waitpid(_pid, nullptr, WNOHANG); // when it is ours
+        return ready > 0;
+    }
+}
+
+void StoreProcess::signal(int number) const { syscall(SYS_pidfd_send_signal, _handle.get(), number, nullptr, 0); }
+
+} // namespace rolvane

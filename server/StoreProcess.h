@@ -1,0 +1,70 @@
+#pragma once
+
+#include <chrono>
+#include <optional>
+#include <string>
+#include <sys/types.h>
+#include <utility>
+#include <vector>
+
+namespace rolvane {
+
+// A file descriptor with an owner.
+class FileHandle {
+public:
+    FileHandle() = default;
+    explicit FileHandle(int fd) : _fd(fd) {}
+    FileHandle(FileHandle&& other) noexcept : _fd(other.release()) {}
+    FileHandle& operator=(FileHandle&& other) noexcept {
+        std::swap(_fd, other._fd);
+        return *this;
+    }
+    ~FileHandle();
+    int get() const { return _fd; }
+    explicit operator bool() const { return _fd >= 0; }
+    int release() { return std::exchange(_fd, -1); }
+
+private:
+    int _fd = -1;
+};
+
+// Whom httpd runs as. An ordinary user's httpd runs as that user.
+struct StoreIdentity {
+    bool change = false; // true when the launcher is root: change to uid and gid
+    uid_t uid = 0;
+    gid_t gid = 0;
+    std::string name;
+    bool passFileModes = false; // keep the right to read and search past file modes
+
+    // www-data, else nobody, for root; the process's own user for anybody else. CXException when root has neither.
+    static StoreIdentity choose();
+    // Whether that user may search every directory on the way to the path, the path itself included.
+    bool reaches(const std::string& path) const;
+    // Hands the file or directory (not what is inside, no symbolic links followed) over to it. CXException on failure.
+    void own(const std::string& path) const;
+    void ownAllIn(const std::string& directory) const; // with what is inside, for small directories
+};
+
+// A running program, seen through a pidfd, so that a number that was given to somebody else is never taken for it.
+class StoreProcess {
+public:
+    // The process with that number if its command line names the configuration file; nothing else passes for a store.
+    static std::optional<StoreProcess> find(pid_t pid, const std::string& configurationFile);
+    // Starts it in a session of its own, standard error and output in the file, no other descriptor inherited.
+    // CXException when it cannot be run.
+    static StoreProcess launch(const std::vector<std::string>& command, const StoreIdentity& identity,
+                               const std::string& outputFile);
+
+    pid_t pid() const { return _pid; }
+    bool hasExited() const { return waitForExit(std::chrono::milliseconds(0)); }
+    bool waitForExit(std::chrono::milliseconds timeout) const; // false when the time ran out; takes the status of a child
+    void signal(int number) const;
+    int handle() const { return _handle.get(); } // readable when it has exited
+
+private:
+    StoreProcess(pid_t pid, FileHandle handle) : _pid(pid), _handle(std::move(handle)) {}
+    pid_t _pid;
+    FileHandle _handle;
+};
+
+} // namespace rolvane
