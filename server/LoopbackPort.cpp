@@ -4,13 +4,15 @@
 #include "server/StoreProcess.h"
 
 #include <arpa/inet.h>
-#include <cstring>
 #include <fstream>
+#include <memory>
 #include <netinet/in.h>
-#include <poll.h>
+#include <openssl/err.h>
+#include <openssl/ssl.h>
 #include <random>
 #include <string_view>
 #include <sys/socket.h>
+#include <sys/time.h>
 
 namespace rolvane {
 
@@ -46,16 +48,32 @@ int firstOutgoingPort() {
     return first;
 }
 
-bool waitFor(int fd, short events, std::chrono::milliseconds timeout) {
-    pollfd descriptor{fd, events, 0};
-    return poll(&descriptor, 1, static_cast<int>(timeout.count())) > 0;
+bool answersInClear(int fd) {
+    constexpr std::string_view request = "OPTIONS * HTTP/1.0\r\n\r\n";
+    if (send(fd, request.data(), request.size(), MSG_NOSIGNAL) != static_cast<ssize_t>(request.size())) return false;
+    char answer;
+    return recv(fd, &answer, 1, 0) == 1;
+}
+
+// Nothing is sent over it, so whose certificate it is does not matter here.
+bool shakesHands(int fd) {
+    const std::unique_ptr<SSL_CTX, decltype(&SSL_CTX_free)> context(SSL_CTX_new(TLS_client_method()), &SSL_CTX_free);
+    const std::unique_ptr<SSL, decltype(&SSL_free)> session(context ? SSL_new(context.get()) : nullptr, &SSL_free);
+    const bool good = session && SSL_set_fd(session.get(), fd) == 1 && SSL_connect(session.get()) == 1;
+    if (good) SSL_shutdown(session.get());
+    ERR_clear_error();
+    return good;
 }
 
 } // namespace
 
-bool LoopbackPort::hasIPv6() { return static_cast<bool>(boundIPv6(0)); }
+bool LoopbackPort::hasIPv6() {
+    return static_cast<bool>(boundIPv6(0));
+}
 
-bool LoopbackPort::isFree(int port) { return boundIPv4(port) && (!hasIPv6() || boundIPv6(port)); }
+bool LoopbackPort::isFree(int port) {
+    return boundIPv4(port) && (!hasIPv6() || boundIPv6(port));
+}
 
 int LoopbackPort::choose() {
     const int last = firstOutgoingPort() > 12000 ? firstOutgoingPort() - 1 : 65535;
@@ -65,22 +83,21 @@ int LoopbackPort::choose() {
         const int port = any(random);
         if (isFree(port)) return port;
     }
-    throw CXException("CXPrivateStoreException",
-                      "No free port was found on this machine's loopback address. Choose one for the store with --port.");
+    throw CXException(
+        "CXPrivateStoreException",
+        "No free port was found on this machine's loopback address. Choose one for the store with --port.");
 }
 
-bool LoopbackPort::answersHTTP(int port, std::chrono::milliseconds timeout) {
+bool LoopbackPort::answers(int port, bool tls, std::chrono::seconds timeout) {
     FileHandle handle(socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    const timeval limit{timeout.count(), 0};
+    setsockopt(handle.get(), SOL_SOCKET, SO_RCVTIMEO, &limit, sizeof limit);
     sockaddr_in address{};
     address.sin_family = AF_INET;
     address.sin_port = htons(static_cast<uint16_t>(port));
     address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
     if (connect(handle.get(), reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) return false;
-    constexpr std::string_view request = "OPTIONS * HTTP/1.0\r\n\r\n";
-    if (send(handle.get(), request.data(), request.size(), MSG_NOSIGNAL) != static_cast<ssize_t>(request.size())) return false;
-    char answer[5];
-    return waitFor(handle.get(), POLLIN, timeout) && recv(handle.get(), answer, sizeof answer, MSG_WAITALL) == 5 &&
-           std::memcmp(answer, "HTTP/", 5) == 0;
+    return tls ? shakesHands(handle.get()) : answersInClear(handle.get());
 }
 
 } // namespace rolvane

@@ -12,8 +12,8 @@ public:
     // A free one below the range from which the kernel takes the ports of outgoing connections, so that none of those
     // can sit on it while the store is stopped. CXException when none was found.
     static int choose();
-    // Whether whoever listens there speaks HTTP: a request in clear, to which httpd answers on a TLS port, too.
-    static bool answersHTTP(int port, std::chrono::milliseconds timeout);
+    // Whether whoever listens there answers: a request in clear, or the opening of a TLS connection.
+    static bool answers(int port, bool tls, std::chrono::seconds timeout);
 };
 
 } // namespace rolvane

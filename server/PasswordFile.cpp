@@ -74,7 +74,8 @@ void appendBase64(std::string& out, unsigned value, int characters) {
 std::string randomSalt() {
     std::array<unsigned char, 8> bytes;
     if (RAND_bytes(bytes.data(), bytes.size()) != 1)
-        throw CXException("CXPrivateStoreException", "No random numbers are to be had from OpenSSL for a password's salt.");
+        throw CXException("CXPrivateStoreException",
+                          "No random numbers are to be had from OpenSSL for a password's salt.");
     std::string salt;
     for (unsigned char byte : bytes) salt += kSaltAlphabet[byte % kSaltAlphabet.size()];
     return salt;
@@ -143,7 +144,9 @@ std::vector<std::string> PasswordFile::users() const {
     return names;
 }
 
-bool PasswordFile::contains(std::string_view user) const { return readEntries(_passwords).contains(user); }
+bool PasswordFile::contains(std::string_view user) const {
+    return readEntries(_passwords).contains(user);
+}
 
 void PasswordFile::set(const std::string& user, const std::string& password) {
     auto passwords = readEntries(_passwords);

@@ -28,9 +28,13 @@ using namespace std::chrono_literals;
 constexpr auto kStartDeadline = 10s;
 constexpr int kFreshPortAttempts = 5;
 
-[[noreturn]] void fail(const std::string& reason) { throw CXException(kCXPrivateStoreException, reason); }
+[[noreturn]] void fail(const std::string& reason) {
+    throw CXException(kCXPrivateStoreException, reason);
+}
 
-bool exists(const std::string& path) { return access(path.c_str(), F_OK) == 0; }
+bool exists(const std::string& path) {
+    return access(path.c_str(), F_OK) == 0;
+}
 
 // httpd compares paths as texts: no section would apply below a symbolic link.
 std::string withoutLinks(const std::string& path) {
@@ -43,7 +47,9 @@ std::string orDefault(const std::string& stateDirectory) {
     return withoutLinks(stateDirectory.empty() ? rolvane::stateDirectory() + "/store" : stateDirectory);
 }
 
-std::string readIfThere(const std::string& path) { return exists(path) ? readFile(path) : std::string(); }
+std::string readIfThere(const std::string& path) {
+    return exists(path) ? readFile(path) : std::string();
+}
 
 // Held by a launcher while it starts, stops or changes a store; one that comes second waits.
 class LauncherLock {
@@ -51,7 +57,8 @@ public:
     explicit LauncherLock(const std::string& stateDirectory)
         : _file(open((stateDirectory + "/launcher.lock").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600)) {
         while (_file && flock(_file.get(), LOCK_EX) != 0)
-            if (errno != EINTR) fail("The store's directory " + stateDirectory + " cannot be locked: " + std::strerror(errno) + ".");
+            if (errno != EINTR)
+                fail("The store's directory " + stateDirectory + " cannot be locked: " + std::strerror(errno) + ".");
         if (!_file) fail("The store's directory " + stateDirectory + " cannot be used: " + std::strerror(errno) + ".");
     }
 
@@ -63,7 +70,8 @@ private:
 class DirectoryWatch {
 public:
     explicit DirectoryWatch(const std::string& directory) : _events(inotify_init1(IN_CLOEXEC | IN_NONBLOCK)) {
-        if (!_events || inotify_add_watch(_events.get(), directory.c_str(), IN_CREATE | IN_MOVED_TO | IN_CLOSE_WRITE) < 0)
+        if (!_events ||
+            inotify_add_watch(_events.get(), directory.c_str(), IN_CREATE | IN_MOVED_TO | IN_CLOSE_WRITE) < 0)
             fail("The store's directory " + directory + " cannot be watched: " + std::strerror(errno) + ".");
     }
     // Until something happened in the directory, the process ended, or the time ran out.
@@ -71,7 +79,8 @@ public:
         pollfd descriptors[] = {{_events.get(), POLLIN, 0}, {process.handle(), POLLIN, 0}};
         poll(descriptors, 2, static_cast<int>(std::max<long>(timeout.count(), 0)));
         char drained[4096];
-        while (read(_events.get(), drained, sizeof drained) > 0) {}
+        while (read(_events.get(), drained, sizeof drained) > 0) {
+        }
     }
 
 private:
@@ -85,7 +94,8 @@ struct PrivateStore::Implementation {
     std::string state;
     bool startedHere = false;
 
-    explicit Implementation(PrivateStoreOptions given) : options(std::move(given)), state(orDefault(options.stateDirectory)) {
+    explicit Implementation(PrivateStoreOptions given)
+        : options(std::move(given)), state(orDefault(options.stateDirectory)) {
         if (options.documentRoot.empty()) options.documentRoot = state + "/root";
         options.documentRoot = withoutLinks(options.documentRoot);
         options.stateDirectory = state;
@@ -107,6 +117,7 @@ struct PrivateStore::Implementation {
     std::optional<StoreProcess> running() const;
     StoreIdentity identityFor() const;
     void checkProgram() const;
+    void endOrphans() const;
     void writeConfiguration(int port);
     void handOver(const StoreIdentity& identity) const;
     void startLocked();
@@ -153,10 +164,18 @@ void PrivateStore::Implementation::checkProgram() const {
                  ". Install the package apache2-bin again (apt-get install --reinstall apache2-bin).");
 }
 
+// A master that was killed leaves workers behind, which go on serving and hold the port.
+void PrivateStore::Implementation::endOrphans() const {
+    for (const auto& worker : StoreProcess::findAll(configurationFile())) {
+        worker.signal(SIGKILL);
+        worker.waitForExit(5s);
+    }
+}
+
 void PrivateStore::Implementation::writeConfiguration(int port) {
     if (options.tls) certificates().ensure(options.hosts, options.certificateLifetime);
-    writeFileDurably(configurationFile(), renderStoreConfiguration(readFile(storeTemplatePath()), options, port,
-                                                                   LoopbackPort::hasIPv6()));
+    writeFileDurably(configurationFile(),
+                     renderStoreConfiguration(readFile(storeTemplatePath()), options, port, LoopbackPort::hasIPv6()));
     writeFileDurably(state + "/conf/users.conf",
                      renderStoreUsers(davDirectory(), passwords().users(), options.authentication));
     writeFileDurably(settingsFile(), PropertyList::toXML(storeOptionsToDictionary(options, port)));
@@ -173,6 +192,7 @@ void PrivateStore::Implementation::handOver(const StoreIdentity& identity) const
 void PrivateStore::Implementation::startLocked() {
     if (running()) return;
     checkProgram();
+    endOrphans();
     const StoreIdentity identity = identityFor();
     int port = options.port ? options.port : savedPort();
     const bool fresh = port == 0;
@@ -217,7 +237,7 @@ void PrivateStore::Implementation::waitUntilReady(const StoreProcess& process, i
         if (left <= 0ms) fail("The store's httpd did not listen within 10 seconds. " + explanation(logStart));
         watch.wait(process, left);
     }
-    if (!LoopbackPort::answersHTTP(port, kStartDeadline) || process.hasExited())
+    if (!LoopbackPort::answers(port, options.tls, kStartDeadline) || process.hasExited())
         fail("The store's httpd listens, but does not answer. " + explanation(logStart));
 }
 
@@ -232,6 +252,7 @@ std::string PrivateStore::Implementation::explanation(size_t logStart) const {
 void PrivateStore::Implementation::stopLocked(Stop how) {
     const auto process = running();
     if (!process) {
+        endOrphans();
         unlink(pidFile().c_str());
         return;
     }
@@ -275,7 +296,8 @@ PrivateStore::~PrivateStore() {
 std::optional<PrivateStoreOptions> PrivateStore::savedOptions(const std::string& stateDirectory) {
     const std::string state = orDefault(stateDirectory);
     if (!exists(state + "/store.plist")) return std::nullopt;
-    PrivateStoreOptions options = storeOptionsFromDictionary(PropertyList::fromFile(state + "/store.plist").dictionary());
+    PrivateStoreOptions options =
+        storeOptionsFromDictionary(PropertyList::fromFile(state + "/store.plist").dictionary());
     options.stateDirectory = state;
     return options;
 }
@@ -304,8 +326,9 @@ PrivateStoreStatus PrivateStore::status() const {
 
 void PrivateStore::addUser(const std::string& user, const std::string& password) {
     if (!PasswordFile::isValidUser(user))
-        fail("\"" + user + "\" cannot be a user of the store: use up to 64 letters, digits and . _ - @ +, and begin with "
-                           "a letter, a digit or _.");
+        fail("\"" + user +
+             "\" cannot be a user of the store: use up to 64 letters, digits and . _ - @ +, and begin with "
+             "a letter, a digit or _.");
     if (password.empty() || password.find_first_of(std::string("\n\r\0", 3)) != std::string::npos)
         fail("The password of " + user + " must not be empty or hold a line break. Choose another one.");
     _implementation->makeDirectories();
@@ -325,20 +348,36 @@ bool PrivateStore::removeUser(const std::string& user) {
     return true;
 }
 
-std::vector<std::string> PrivateStore::users() const { return _implementation->passwords().users(); }
+std::vector<std::string> PrivateStore::users() const {
+    return _implementation->passwords().users();
+}
 
-std::string PrivateStore::stateDirectory() const { return _implementation->state; }
-std::string PrivateStore::documentRoot() const { return _implementation->options.documentRoot; }
-std::string PrivateStore::userDirectory(const std::string& user) const { return _implementation->davDirectory() + "/" + user; }
-std::string PrivateStore::caFile() const { return _implementation->certificates().caFile(); }
-std::string PrivateStore::errorLog() const { return _implementation->errorLog(); }
+std::string PrivateStore::stateDirectory() const {
+    return _implementation->state;
+}
+std::string PrivateStore::documentRoot() const {
+    return _implementation->options.documentRoot;
+}
+std::string PrivateStore::userDirectory(const std::string& user) const {
+    return _implementation->davDirectory() + "/" + user;
+}
+std::string PrivateStore::caFile() const {
+    return _implementation->certificates().caFile();
+}
+std::string PrivateStore::errorLog() const {
+    return _implementation->errorLog();
+}
 
 std::string PrivateStore::baseURL() const {
     const int port = _implementation->savedPort();
-    if (port == 0) fail("The store in " + stateDirectory() + " has never been started. Start it with: rolvane store start");
-    return (_implementation->options.tls ? "https" : "http") + std::string("://localhost:") + std::to_string(port) + "/dav";
+    if (port == 0)
+        fail("The store in " + stateDirectory() + " has never been started. Start it with: rolvane store start");
+    return (_implementation->options.tls ? "https" : "http") + std::string("://localhost:") + std::to_string(port) +
+           "/dav";
 }
 
-std::string PrivateStore::endpointTemplate() const { return baseURL() + "/{user}/Contacts"; }
+std::string PrivateStore::endpointTemplate() const {
+    return baseURL() + "/{user}/Contacts";
+}
 
 } // namespace rolvane

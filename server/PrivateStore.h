@@ -23,13 +23,13 @@ struct PrivateStoreOptions {
     bool http2 = true;
     std::vector<std::string> hosts = {"localhost", "127.0.0.1", "::1"}; // names and addresses in the certificate
 
-    int processes = 1;             // at start; grows up to maximumProcesses
+    int processes = 1; // at start; grows up to maximumProcesses
     int maximumProcesses = 4;
     int threadsPerProcess = 32;
     int keepAliveSeconds = 60;
-    int maximumKeepAliveRequests = 0; // 0 = no limit
-    std::string logLevel = "warn";    // httpd's LogLevel
-    bool accessLog = false;           // a line a request in logs/access.log
+    int maximumKeepAliveRequests = 0;            // 0 = no limit
+    std::string logLevel = "warn";               // httpd's LogLevel
+    bool accessLog = false;                      // a line a request in logs/access.log
     std::vector<std::string> extraConfiguration; // lines at the end of the configuration
 
     bool ownsProcess = false; // the destructor stops the store (tests); else it goes on running

@@ -127,7 +127,8 @@ bool isAddress(const std::string& host) {
 
 std::string alternativeNames(const std::vector<std::string>& hosts) {
     std::string names;
-    for (const auto& host : hosts) names += (names.empty() ? "" : ",") + std::string(isAddress(host) ? "IP:" : "DNS:") + host;
+    for (const auto& host : hosts)
+        names += (names.empty() ? "" : ",") + std::string(isAddress(host) ? "IP:" : "DNS:") + host;
     return names;
 }
 

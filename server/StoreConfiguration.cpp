@@ -90,7 +90,8 @@ std::string storeTemplatePath() {
 
 std::string renderStoreConfiguration(const std::string& templateText, const PrivateStoreOptions& options, int port,
                                      bool withIPv6) {
-    for (const auto& path : {options.stateDirectory, options.documentRoot, options.httpdModules}) refuseUnsafePath(path);
+    for (const auto& path : {options.stateDirectory, options.documentRoot, options.httpdModules})
+        refuseUnsafePath(path);
     refuseUnsafeWord("log level", options.logLevel);
     const std::string number = std::to_string(port);
     const int threads = std::clamp(options.threadsPerProcess, 1, 1000);

@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <csignal>
+#include <cstdlib>
 #include <cstring>
 #include <fcntl.h>
 #include <filesystem>
@@ -24,17 +25,22 @@ namespace rolvane {
 
 namespace {
 
-[[noreturn]] void fail(const std::string& reason) { throw CXException("CXPrivateStoreException", reason); }
+[[noreturn]] void fail(const std::string& reason) {
+    throw CXException("CXPrivateStoreException", reason);
+}
 
 // What follows runs between fork and exec: system calls only.
 
-bool inBoundingSet(int capability) { return prctl(PR_CAPBSET_READ, capability, 0, 0, 0) == 1; }
+bool inBoundingSet(int capability) {
+    return prctl(PR_CAPBSET_READ, capability, 0, 0, 0) == 1;
+}
 
 bool keepCapability(int capability) {
     __user_cap_header_struct header{_LINUX_CAPABILITY_VERSION_3, 0};
     __user_cap_data_struct data[2] = {};
     data[0].effective = data[0].permitted = data[0].inheritable = 1u << capability;
-    return syscall(SYS_capset, &header, data) == 0 && prctl(PR_CAP_AMBIENT, PR_CAP_AMBIENT_RAISE, capability, 0, 0) == 0;
+    return syscall(SYS_capset, &header, data) == 0 &&
+           prctl(PR_CAP_AMBIENT, PR_CAP_AMBIENT_RAISE, capability, 0, 0) == 0;
 }
 
 bool becomeIdentity(const StoreIdentity& identity) {
@@ -68,7 +74,9 @@ bool becomeIdentity(const StoreIdentity& identity) {
     _exit(127);
 }
 
-FileHandle pidHandle(pid_t pid) { return FileHandle(static_cast<int>(syscall(SYS_pidfd_open, pid, 0))); }
+FileHandle pidHandle(pid_t pid) {
+    return FileHandle(static_cast<int>(syscall(SYS_pidfd_open, pid, 0)));
+}
 
 std::string commandLine(pid_t pid) {
     std::ifstream file("/proc/" + std::to_string(pid) + "/cmdline", std::ios::binary);
@@ -96,8 +104,9 @@ StoreIdentity StoreIdentity::choose() {
             return identity;
         }
     }
-    fail("The store's httpd does not run as root, and there is neither a user www-data nor nobody to run it as. Add one "
-         "of them, or start the store as an ordinary user.");
+    fail(
+        "The store's httpd does not run as root, and there is neither a user www-data nor nobody to run it as. Add one "
+        "of them, or start the store as an ordinary user.");
 }
 
 bool StoreIdentity::reaches(const std::string& path) const {
@@ -140,6 +149,15 @@ std::optional<StoreProcess> StoreProcess::find(pid_t pid, const std::string& con
     return process;
 }
 
+std::vector<StoreProcess> StoreProcess::findAll(const std::string& configurationFile) {
+    std::vector<StoreProcess> all;
+    for (const auto& entry : std::filesystem::directory_iterator("/proc")) {
+        const pid_t pid = static_cast<pid_t>(std::atol(entry.path().filename().c_str()));
+        if (auto process = find(pid, configurationFile)) all.push_back(std::move(*process));
+    }
+    return all;
+}
+
 StoreProcess StoreProcess::launch(const std::vector<std::string>& command, const StoreIdentity& identity,
                                   const std::string& outputFile) {
     FileHandle output(open(outputFile.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600));
@@ -159,7 +177,8 @@ StoreProcess StoreProcess::launch(const std::vector<std::string>& command, const
     writing = FileHandle();
     int error = 0;
     ssize_t got;
-    while ((got = read(reading.get(), &error, sizeof error)) < 0 && errno == EINTR) {}
+    while ((got = read(reading.get(), &error, sizeof error)) < 0 && errno == EINTR) {
+    }
     if (got == sizeof error) {
         waitpid(pid, nullptr, 0);
         fail("The store's program " + command.front() + " cannot be run" +
@@ -171,7 +190,8 @@ StoreProcess StoreProcess::launch(const std::vector<std::string>& command, const
 bool StoreProcess::waitForExit(std::chrono::milliseconds timeout) const {
     const auto deadline = std::chrono::steady_clock::now() + timeout;
     for (;;) {
-        const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
+        const auto left =
+            std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
         pollfd descriptor{_handle.get(), POLLIN, 0};
         const int ready = poll(&descriptor, 1, static_cast<int>(std::max<long>(left.count(), 0)));
         if (ready < 0 && errno == EINTR) continue;
@@ -180,6 +200,8 @@ bool StoreProcess::waitForExit(std::chrono::milliseconds timeout) const {
     }
 }
 
-void StoreProcess::signal(int number) const { syscall(SYS_pidfd_send_signal, _handle.get(), number, nullptr, 0); }
+void StoreProcess::signal(int number) const {
+    syscall(SYS_pidfd_send_signal, _handle.get(), number, nullptr, 0);
+}
 
 } // namespace rolvane

@@ -50,6 +50,8 @@ class StoreProcess {
 public:
     // The process with that number if its command line names the configuration file; nothing else passes for a store.
     static std::optional<StoreProcess> find(pid_t pid, const std::string& configurationFile);
+    // Every such process of this machine: httpd's master and its workers.
+    static std::vector<StoreProcess> findAll(const std::string& configurationFile);
     // Starts it in a session of its own, standard error and output in the file, no other descriptor inherited.
     // CXException when it cannot be run.
     static StoreProcess launch(const std::vector<std::string>& command, const StoreIdentity& identity,
@@ -57,7 +59,8 @@ public:
 
     pid_t pid() const { return _pid; }
     bool hasExited() const { return waitForExit(std::chrono::milliseconds(0)); }
-    bool waitForExit(std::chrono::milliseconds timeout) const; // false when the time ran out; takes the status of a child
+    bool
+    waitForExit(std::chrono::milliseconds timeout) const; // false when the time ran out; takes the status of a child
     void signal(int number) const;
     int handle() const { return _handle.get(); } // readable when it has exited
 

@@ -61,10 +61,10 @@ CurlClient::CurlClient(const PrivateStore& store, std::string user, std::string 
 HTTPAnswer CurlClient::request(const std::string& method, const std::string& path,
                                const std::vector<std::string>& headers, const std::optional<std::string>& body) const {
     const StoreDirectory files;
-    std::vector<std::string> command = {"curl",     "-q",      "-sS",          "--noproxy", "*",
-                                        "--path-as-is", "--cacert", _caFile, "--max-time", "20",
-                                        "-X",       method,    "-D",           files.path("headers"),
-                                        "-o",       files.path("body"), "-w", "%{http_code}"};
+    std::vector<std::string> command = {
+        "curl",       "-q",          "-sS", "--noproxy", "*",  "--path-as-is",        "--cacert", _caFile,
+        "--max-time", "20",          "-X",  method,      "-D", files.path("headers"), "-o",       files.path("body"),
+        "-w",         "%{http_code}"};
     command.insert(command.end(), extraArguments.begin(), extraArguments.end());
     if (!_credentials.empty()) command.insert(command.end(), {_scheme, "-u", _credentials});
     for (const auto& header : headers) command.insert(command.end(), {"-H", header});
