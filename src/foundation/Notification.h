@@ -6,6 +6,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <vector>
 
 namespace rolvane {
 
@@ -18,7 +19,8 @@ struct Notification {
 };
 using NotificationHandler = std::function<void(const Notification&)>;
 
-// Ends its registration when destroyed.
+// Ends its registration when destroyed: the handler is not called again. Destroying it on another thread than the
+// handler's does not wait for a call that is under way. It may outlive its centre.
 class Observation {
 public:
     virtual ~Observation() = default;
@@ -26,7 +28,8 @@ public:
 using ObservationHandle = std::unique_ptr<Observation>;
 
 // The process's own notification centre. `post` calls the observers on the posting thread, in order of registration,
-// before it returns; an observer may register and end registrations meanwhile. Any thread.
+// before it returns; an observer may register and end registrations meanwhile (one that is new hears from the next post
+// on). What a handler throws reaches the poster. Any thread.
 class NotificationCenter {
 public:
     NotificationCenter();
@@ -41,13 +44,18 @@ private:
 };
 
 // Notifications between the processes of one user. Exists as an interface so that tests can replace the bus.
+// A name is a D-Bus member ([A-Za-z_][A-Za-z0-9_]*, at most 255 bytes); others throw kCXInvalidArgumentException.
+// All but `post` and `connected` is called on the run loop's thread.
 class DistributedNotifications {
 public:
     virtual ~DistributedNotifications() = default;
     // Delivers immediately; true when it went out. Any thread. Without a bus nothing happens and false is returned.
+    // Never waits for an answer. A bus that is slow or hangs holds up the poster for a fraction of a second in all;
+    // from then on a bounded number of notifications waits for it (true), and further ones are dropped (false).
     virtual bool post(const Notification& notification) = 0;
     // The handler runs on the run loop that was given at construction. Coalescing: while `suspended` or while the loop
-    // is busy, equal names are delivered once, with the latest user data.
+    // is busy, equal names are delivered once, with the latest user data, in the place of the earliest. Without
+    // coalescing all are delivered in order; of those that wait the oldest go when there are more than 10,000.
     [[nodiscard]] virtual ObservationHandle observe(std::string name, NotificationHandler handler, bool coalesce) = 0;
     virtual void setSuspended(bool suspended) = 0;
     virtual bool connected() const = 0;
@@ -55,10 +63,16 @@ public:
 
 // D-Bus signals on the session bus: path /net/rolvane/Notifications, interface net.rolvane.Notifications, member = the
 // notification's name, body a{sv} (user data; the object string, when present, under the key "object").
-// Observers hear their own process's signals too. `address` none: the session bus of the environment.
+// Values: boolean b, integer x, real d, string s (what is not UTF-8 is replaced), date (d), data ay, array av,
+// dictionary a{sv}, absent in an array g. Signals with another body are heard with what can be read of it. Observers
+// hear their own process's signals too; what `observe` was called for is heard from its return on. A bus that went away
+// is looked for with the next `post`, and every few seconds while anything is observed. `address` none: the session bus
+// of the environment ($DBUS_SESSION_BUS_ADDRESS, else $XDG_RUNTIME_DIR/bus), as it is now.
 std::unique_ptr<DistributedNotifications> makeBusNotifications(RunLoop& loop,
                                                                std::optional<std::string> address = std::nullopt);
-// In memory, for tests and for a process without a bus: records what is posted and delivers at once to its observers.
+
+// In memory, for tests and for a process without a bus: records what is posted and delivers at once, on the posting
+// thread, to its observers. `post` is true. Any thread.
 class LocalNotifications : public DistributedNotifications {
 public:
     LocalNotifications();
