@@ -1,5 +1,6 @@
 #pragma once
 
+#include <atomic>
 #include <chrono>
 #include <compare>
 #include <limits>
@@ -56,13 +57,13 @@ public:
 // A clock that stands until it is moved. For tests; any thread may read it, one moves it.
 class ManualClock : public Clock {
 public:
-    explicit ManualClock(Date start) : _now(start) {}
-    Date now() const override { return _now; }
-    void set(Date d) { _now = d; }
-    void advance(double seconds) { _now = _now.addingSeconds(seconds); }
+    explicit ManualClock(Date start) : _now(start.secondsSince1970()) {}
+    Date now() const override { return Date(_now.load()); }
+    void set(Date d) { _now = d.secondsSince1970(); }
+    void advance(double seconds) { _now = _now.load() + seconds; }
 
 private:
-    Date _now;
+    std::atomic<double> _now;
 };
 
 } // namespace rolvane

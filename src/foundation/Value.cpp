@@ -1,9 +1,11 @@
 #include "foundation/Value.h"
 
 #include <algorithm>
+#include <atomic>
 #include <charconv>
 #include <cmath>
 #include <fmt/format.h>
+#include <unordered_map>
 
 namespace rolvane {
 
@@ -19,29 +21,39 @@ struct StringHash {
 
 } // namespace
 
-// `index` counts the string elements: built on first need, dropped after a write that it cannot follow.
+// `index` counts the string elements: built on first need, dropped after a write that it cannot follow. Readers on
+// several threads may need it at once: each builds its own and the first one to finish is kept.
 struct Array::Storage {
     using Index = std::unordered_map<std::string, size_t, StringHash, std::equal_to<>>;
     std::vector<Value> items;
-    mutable std::unique_ptr<Index> index;
+    mutable std::atomic<Index*> index{nullptr};
+
+    Storage() = default;
+    Storage(const Storage&) = delete;
+    Storage& operator=(const Storage&) = delete;
+    ~Storage() { delete index.load(); }
 
     const Index& counted() const {
-        if (!index) {
-            index = std::make_unique<Index>(items.size());
-            for (const Value& v : items) added(v);
-        }
-        return *index;
+        if (const Index* built = index.load(std::memory_order_acquire)) return *built;
+        auto fresh = std::make_unique<Index>(items.size());
+        for (const Value& v : items)
+            if (const std::string* s = v.stringIf()) ++(*fresh)[*s];
+        Index* none = nullptr;
+        if (index.compare_exchange_strong(none, fresh.get(), std::memory_order_acq_rel)) return *fresh.release();
+        return *none;
     }
-    void added(const Value& v) const {
-        if (!index) return;
-        if (const std::string* s = v.stringIf()) ++(*index)[*s];
+    void added(const Value& v) {
+        Index* built = index.load();
+        if (!built) return;
+        if (const std::string* s = v.stringIf()) ++(*built)[*s];
     }
     void removed(const Value& v) {
-        if (!index) return;
+        Index* built = index.load();
         const std::string* s = v.stringIf();
-        if (!s) return;
-        if (auto it = index->find(*s); it != index->end() && --it->second == 0) index->erase(it);
+        if (!built || !s) return;
+        if (auto it = built->find(*s); it != built->end() && --it->second == 0) built->erase(it);
     }
+    void dropIndex() { delete index.exchange(nullptr); }
 };
 
 Array::Array() : _p(std::make_shared<Storage>()) {}
@@ -105,7 +117,8 @@ void Array::removeAll(const Value& v) {
     const Value wanted = v; // v may live inside this array
     if (!contains(wanted)) return;
     std::erase(_p->items, wanted);
-    if (const std::string* s = wanted.stringIf(); s && _p->index) _p->index->erase(*s);
+    const std::string* s = wanted.stringIf();
+    if (Storage::Index* built = _p->index.load(); built && s) built->erase(*s);
 }
 
 void Array::removeAllOf(const Array& others) {
@@ -113,7 +126,7 @@ void Array::removeAllOf(const Array& others) {
     const Array gone = others.isSame(*this) ? others.mutableCopy() : others;
     const size_t before = count();
     std::erase_if(_p->items, [&](const Value& v) { return gone.contains(v); });
-    if (count() != before) _p->index.reset();
+    if (count() != before) _p->dropIndex();
 }
 
 bool Array::contains(const Value& v) const {
@@ -122,7 +135,7 @@ bool Array::contains(const Value& v) const {
 }
 
 bool Array::containsString(std::string_view s) const {
-    if (count() >= kIndexFrom || _p->index) {
+    if (count() >= kIndexFrom) {
         const auto& index = _p->counted();
         return index.find(s) != index.end();
     }
@@ -310,7 +323,13 @@ Value Value::deepMutableCopy() const {
 
 namespace {
 
+constexpr int kShownDepth = 64; // a container may hold itself
+
 void describe(const Value& v, int depth, std::string& out) {
+    if (depth > kShownDepth) {
+        out += "...";
+        return;
+    }
     const std::string pad(static_cast<size_t>(depth) * 4, ' ');
     switch (v.type()) {
     case ValueType::absent: out += "(null)"; break;
@@ -349,8 +368,19 @@ std::string Value::description() const {
     return out;
 }
 
+namespace {
+
+// Exactly: 2^53 + 1 has no real of its own and equals none. Converting the real is defined only within the range.
+bool isNumberOf(int64_t i, double d) {
+    return d >= -9223372036854775808.0 && d < 9223372036854775808.0 && static_cast<double>(i) == d &&
+           static_cast<int64_t>(d) == i;
+}
+
+} // namespace
+
 bool operator==(const Value& a, const Value& b) {
-    if (a.isNumber() && b.isNumber() && a.type() != b.type()) return a.real() == b.real();
+    if (a.type() == ValueType::integer && b.type() == ValueType::real) return isNumberOf(a.integer(), b.real());
+    if (a.type() == ValueType::real && b.type() == ValueType::integer) return isNumberOf(b.integer(), a.real());
     if (a.type() != b.type()) return false;
     switch (a.type()) {
     case ValueType::string: return a.string() == b.string();

@@ -10,7 +10,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
-#include <unordered_map>
+#include <type_traits>
 #include <utility>
 #include <variant>
 #include <vector>
@@ -109,6 +109,8 @@ public:
     Value(long long i) : _v(static_cast<int64_t>(i)) {}
     Value(unsigned long i) : _v(static_cast<int64_t>(i)) {}
     Value(double d) : _v(d) {}
+    template <class T, class = std::enable_if_t<!std::is_same_v<std::remove_cv_t<T>, char>>>
+    Value(T*) = delete; // or a pointer would become a boolean
     Value(const char* s) : _v(std::make_shared<const std::string>(s)) {}
     Value(std::string s) : _v(std::make_shared<const std::string>(std::move(s))) {}
     Value(std::string_view s) : _v(std::make_shared<const std::string>(s)) {}
@@ -148,7 +150,7 @@ public:
     Value deepMutableCopy() const; // every container inside is new; leaves are shared (they are immutable)
 
     // What "%@" shows: strings as they are at top level and quoted inside containers, containers over several lines,
-    // data as its length, absent as "(null)".
+    // data as its length, absent as "(null)"; what is nested deeper than 64 as "...".
     std::string description() const;
 
     friend bool operator==(const Value& a, const Value& b);
