@@ -177,7 +177,7 @@ TEST(UrlTest, MakesAFileUrlOfAPathAndGivesThePathBack) {
 
 TEST(UrlTest, NoNameLeavesItsDirectoryOnTheWayToAFilePath) {
     const Url base("file:/usr/share/rolvane/");
-    for (const std::string name :
+    for (const std::string& name :
          {std::string(".."), std::string("."), std::string("a/b"), std::string("../../etc"), std::string("a\0b", 3)})
         EXPECT_THROW(base.cxURLByAppendingComponent(name).filePath(), CXException) << name;
     EXPECT_EQ(base.cxURLByAppendingComponent("...").filePath(), "/usr/share/rolvane/...");
