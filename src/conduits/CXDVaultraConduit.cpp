@@ -5,6 +5,7 @@
 #include "conduits/UserAlert.h"
 #include "foundation/Log.h"
 #include "foundation/Preferences.h"
+#include "foundation/PropertyList.h"
 #include "model/PayloadKeys.h"
 #include "model/RemoteLocationMap.h"
 #include "store/CXDAVManager.h"
@@ -14,6 +15,12 @@ namespace rolvane {
 namespace {
 
 constexpr int kForbidden = 403;
+
+// The payload, decoded for this one use where it stands encoded: the record keeps no tree of it.
+Dictionary contentOf(CXDChangeRecord& record) {
+    if (const auto encoded = record.encodedPayload()) return BinaryValue::decode(*encoded).dictionary();
+    return record.payload().dictionary();
+}
 
 using ACLChange = void (CXACLManager::*)(const UniqueId&, const std::vector<UniqueId>&, const UserName&);
 
@@ -191,7 +198,7 @@ bool CXDVaultraConduit::apply(CXDChangeRecord& record, int& code) {
 bool CXDVaultraConduit::updateRecord(CXDChangeRecord& record, int& code) {
     const auto base = baseLocationOf(record);
     if (!base || !record.person()) return false;
-    return _world.manager.write(stringForDictionary(record.payload().dictionary()),
+    return _world.manager.write(stringForDictionary(contentOf(record)),
                                 layout::contactLocation(*base, *record.person()), kSecureRecordWrites, &code);
 }
 
@@ -200,7 +207,7 @@ bool CXDVaultraConduit::createStructureForGroup(CXDChangeRecord& record, int& co
     if (!base || !record.group()) return false;
     // Whether the directory could be made shows in the write below it.
     _world.manager.createDirectoryAtAURL(layout::groupLocation(*base, *record.group()));
-    return _world.manager.write(stringForDictionary(record.payload().dictionary()),
+    return _world.manager.write(stringForDictionary(contentOf(record)),
                                 layout::groupInfoLocation(*base, *record.group()), kSecureRecordWrites, &code);
 }
 

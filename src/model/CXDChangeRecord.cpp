@@ -87,6 +87,10 @@ struct CXDChangeRecord::Payload {
         if (!value && encoded) value = BinaryValue::decode(*encoded);
         return value;
     }
+    std::shared_ptr<const Bytes> untouched() const {
+        const std::lock_guard guard(lock);
+        return value ? nullptr : encoded;
+    }
     Bytes bytes() const {
         const std::lock_guard guard(lock);
         if (value) return BinaryValue::encode(value);
@@ -142,6 +146,10 @@ Value CXDChangeRecord::payload() {
 
 Value CXDChangeRecord::inMemoryPayload() const {
     return _payload ? _payload->decoded() : Value();
+}
+
+std::shared_ptr<const Bytes> CXDChangeRecord::encodedPayload() const {
+    return _payload && !_delayedPayloadURL ? _payload->untouched() : nullptr;
 }
 
 void CXDChangeRecord::packPayload() {

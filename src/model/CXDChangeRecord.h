@@ -86,6 +86,9 @@ public:
     // in-memory payload. Without a delayed payload: the in-memory one, absent when there is none.
     Value payload();
     Value inMemoryPayload() const; // never reads the URL
+    // The payload's bytes while it has no delayed part and nobody has looked inside; null otherwise. Whoever needs the
+    // content once decodes a tree of its own from them, and none stays in the record.
+    std::shared_ptr<const Bytes> encodedPayload() const;
     // Turns a decoded payload back into its encoded form, what was changed in it included, and lets the tree go; a
     // payload that was given as a value is encoded too. For a record that has been handled but must be kept: many of
     // them then stand in memory as bytes. Who still holds the former value holds a tree of its own from then on.

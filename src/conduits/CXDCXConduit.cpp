@@ -1,0 +1,234 @@
+#include "conduits/CXDCXConduit.h"
+
+#include "conduits/ChangeCapture.h"
+#include "conduits/ContactReader.h"
+#include "conduits/GroupComparison.h"
+#include "conduits/RemovalChanges.h"
+#include "contacts/CXRolvane.h"
+#include "contacts/Constants.h"
+#include "contacts/Identifier.h"
+#include "foundation/Preferences.h"
+#include "model/PayloadKeys.h"
+#include "model/RemoteLocationMap.h"
+
+#include <unistd.h>
+
+namespace rolvane {
+namespace {
+
+// From so many changed records on, a group's distribution choices are read at once.
+constexpr size_t kMany = 16;
+
+template <class GroupClass>
+CXSearchElement groupsModifiedAfter(Date date) {
+    return GroupClass::searchElementForProperty(kCXModificationDateProperty, "", "", date, kCXGreaterThan);
+}
+
+} // namespace
+
+CXDCXConduit::CXDCXConduit(ConduitEngine& engine, World world) : CXDConduit(engine), _world(world) {
+    setKillSwitch();
+    _databaseChanged =
+        _world.notifications.observe(kCXDatabaseChangedExternallyNotificationPriv,
+                                     [this](const Notification& notification) { rolvaneChanged(notification); });
+}
+
+CXDCXConduit::~CXDCXConduit() = default;
+
+std::optional<std::string> CXDCXConduit::conduitID() const {
+    return kConduitCX;
+}
+
+int32_t CXDCXConduit::conduitSource() const {
+    return CXDSyncSourceCX;
+}
+
+void CXDCXConduit::setKillSwitch() {
+    const auto writers = rolvane().allGroup()->multiValueForProperty(kCXReadWriteSharingACLProperty);
+    _readOnlyKillSwitch = !writers || writers->empty();
+}
+
+bool CXDCXConduit::applyChangeRecord(const CXDChangeRecordPtr& /*record*/, bool* /*denied*/) {
+    return false;
+}
+
+Dictionary CXDCXConduit::priorState() const {
+    return engine().conduitObjectForKey(kConduitCX, kPriorState);
+}
+
+// -- a pass
+
+void CXDCXConduit::open() {
+    _lastSyncDate = _world.preferences.get(kDaemonDomain, kLastSyncDateKey).date().value_or(Date::distantPast());
+    _scan.reset();
+}
+
+void CXDCXConduit::close() {
+    rolvane().save();
+    CXDConduit::close();
+    _lastSyncDate = _world.clock.now();
+    _world.preferences.set(kDaemonDomain, kLastSyncDateKey, *_lastSyncDate);
+    _world.preferences.synchronize(kDaemonDomain);
+    if (_scan) rolvane().advanceCursorTo(_scan->journalPosition, _scan->since);
+    _scan.reset();
+}
+
+CXDChangeRecords CXDCXConduit::changeRecords() {
+    engine().checkCXShareCount();
+    const Date since = _lastSyncDate.value_or(Date::distantPast());
+    const Scan scan{rolvane().journalPosition(), since};
+
+    ChangeCapture capture(engine(), rolvane(), priorState());
+    capture.reader().expectMany();
+    for (const CXSearchElement& modified :
+         {groupsModifiedAfter<CXGroup>(since), groupsModifiedAfter<CXSubscribedGroup>(since)})
+        for (const CXRecordRef& group : rolvane().recordsMatchingSearchElement(modified))
+            capture.addGroup(std::dynamic_pointer_cast<CXGroup>(group));
+    for (const std::string_view table : {kCXPersonTable, kCXSubscribedPersonTable})
+        rolvane().forEachPersonModifiedSince(since, table,
+                                             [&](const CXRow& person) { capture.addPerson(person, true); });
+    for (const CXSubscriptionRef& subscription : rolvane().subscriptions())
+        if (subscription->_isAll())
+            capture.addGroup(rolvane().allGroupForRemoteLocation(subscription->remoteLocation()));
+    capture.addGroup(rolvane().allGroup());
+
+    _scan = scan;
+    return capture.take();
+}
+
+// -- other processes' saves
+
+void CXDCXConduit::rolvaneChanged(const Notification& notification) {
+    engine().updateStateAndExitIfNeeded();
+    if (notification.userInfo[kCXSenderProcessID].integer() == getpid()) return;
+    engine().checkCXShareCount();
+
+    const Array inserted = notification.userInfo[kCXInsertedRecords].array();
+    const Array updated = notification.userInfo[kCXUpdatedRecords].array();
+    ChangeCapture capture(engine(), rolvane(), priorState());
+    if (inserted.count() + updated.count() >= kMany) capture.reader().expectMany();
+    captureInserted(capture, inserted);
+    captureUpdated(capture, updated);
+    captureDeleted(capture, notification.userInfo[kCXDeletedRecords].array());
+
+    const CXDChangeRecords records = capture.take();
+    if (records.empty())
+        engine().syncPrefs();
+    else
+        engine().applyChangeRecords(records);
+}
+
+void CXDCXConduit::captureInserted(ChangeCapture& capture, const Array& identifiers) {
+    for (const Value& identifier : identifiers) {
+        const CXRecordRef record = recordForUniqueId(UniqueId(identifier.string()));
+        if (const auto group = std::dynamic_pointer_cast<CXGroup>(record))
+            capture.addGroup(group);
+        else if (std::dynamic_pointer_cast<CXPerson>(record))
+            capture.addPerson(rolvane().personRow(record->uniqueId()), false);
+    }
+}
+
+void CXDCXConduit::captureUpdated(ChangeCapture& capture, const Array& identifiers) {
+    for (const Value& identifier : identifiers) {
+        const CXRecordRef record = recordForUniqueId(UniqueId(identifier.string()));
+        if (const auto group = std::dynamic_pointer_cast<CXGroup>(record))
+            capture.addGroup(group);
+        else if (std::dynamic_pointer_cast<CXPerson>(record))
+            capture.addPerson(rolvane().personRow(record->uniqueId()), true);
+        else if (const auto contents = std::dynamic_pointer_cast<CXGroupContents>(record))
+            // The very group whose contents changed, not a subscribed copy of it.
+            capture.addGroup(std::dynamic_pointer_cast<CXGroup>(rolvane().recordForUniqueId(contents->nts_GroupUID())));
+        else if (std::dynamic_pointer_cast<CXInfo>(record))
+            capture.addGroup(rolvane().allGroup());
+    }
+}
+
+void CXDCXConduit::captureDeleted(ChangeCapture& capture, const Array& identifiers) {
+    std::vector<UniqueId> deleted;
+    for (const Value& identifier : identifiers) deleted.emplace_back(identifier.string());
+    // First: what a revocation forgets must not be withdrawn from its publisher's store.
+    lookForRevokedSubscriptions(deleted);
+    const RemovalChanges removals(priorState(), deleted.size());
+    for (const UniqueId& identifier : deleted) {
+        const UniqueId normalized = cxNormalizedUID(identifier);
+        if (normalized.endsWith(kCXGroupTable))
+            capture.add(removals.changesToRemoveGroup(normalized));
+        else if (normalized.endsWith(kCXPersonTable))
+            capture.add(removals.changesToRemovePerson(normalized));
+    }
+}
+
+void CXDCXConduit::lookForRevokedSubscriptions(const std::vector<UniqueId>& deleted) {
+    for (const UniqueId& identifier : deleted) {
+        if (!identifier.endsWith(kCXSubscriptionTable)) continue;
+        if (const auto location = engine().remoteLocationForSubscriptionUID(identifier))
+            engine().revokeRemoteLocation(*location, identifier);
+    }
+}
+
+// -- single generators
+
+CXDChangeRecords CXDCXConduit::changesForPerson(const std::shared_ptr<CXPerson>& person, bool update) {
+    ChangeCapture capture(engine(), rolvane(), priorState());
+    if (person) capture.addPerson(rolvane().personRow(person->uniqueId()), update);
+    return capture.take();
+}
+
+CXDChangeRecords CXDCXConduit::changesForGroup(const std::shared_ptr<CXGroup>& group) {
+    ChangeCapture capture(engine(), rolvane(), priorState());
+    capture.addGroup(group);
+    return capture.take();
+}
+
+CXDChangeRecords CXDCXConduit::compareGroupPriorStateToCurrentState(const Value& prior, const Value& current,
+                                                                    const UniqueId& guid,
+                                                                    const RemoteLocation& location) {
+    ChangeCapture capture(engine(), rolvane(), priorState());
+    capture.addComparison(prior, current, guid, location, nullptr);
+    return capture.take();
+}
+
+CXDChangeRecords CXDCXConduit::compareDistributionPriorStateToCurrentState(const Value& prior, const Value& current,
+                                                                           const UniqueId& guid, const UserName& user,
+                                                                           int32_t sources) {
+    return compareDistributionStates(prior.dictionary(), current.dictionary(), {guid, user, sources, std::nullopt});
+}
+
+Dictionary CXDCXConduit::currentDistributionListStateForGroup(const std::shared_ptr<CXGroup>& group) {
+    return ContactReader::distributionListState(*group);
+}
+
+CXDChangeRecords CXDCXConduit::distributionListChangesForPerson(const std::shared_ptr<CXPerson>& person,
+                                                                int32_t sources, const UserName& user) {
+    ChangeCapture capture(engine(), rolvane(), priorState());
+    if (const auto row = rolvane().personRow(person->uniqueId())) capture.addDistributionLists(*row, sources, user);
+    return capture.take();
+}
+
+CXDChangeRecords CXDCXConduit::changesToRemovePerson(const UniqueId& person) {
+    return RemovalChanges(priorState()).changesToRemovePerson(person);
+}
+
+CXDChangeRecords CXDCXConduit::changesToRemoveGroup(const UniqueId& group) {
+    return RemovalChanges(priorState()).changesToRemoveGroup(group);
+}
+
+CXDChangeRecords CXDCXConduit::generateChangeRecordsToRevokeGroupUID(const UniqueId& group) {
+    auto record = std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, CXDDeleteGroup, kSelf, std::nullopt,
+                                                    cxUIDWithTableName(group, kCXGroupTable));
+    record->setAppliesToSources(engine().sourcesForGUID(group));
+    return {std::move(record)};
+}
+
+CXRecordRef CXDCXConduit::recordForUniqueId(const UniqueId& uid) {
+    return ContactReader(rolvane()).recordForUniqueId(uid);
+}
+
+int32_t CXDCXConduit::sourcesFromRemoteLocations(const CXMultiValue& locations) const {
+    int32_t sources = 0;
+    for (const auto& entry : locations.entries())
+        sources |= syncSourceForRemoteLocation(RemoteLocation(entry.value.string()));
+    return sources;
+}
+
+} // namespace rolvane

@@ -1,0 +1,66 @@
+#pragma once
+
+#include "conduits/ConduitEngine.h"
+#include "conduits/ContactReader.h"
+#include "conduits/GroupComparison.h"
+#include "model/CXDChangeRecord.h"
+
+#include <memory>
+#include <set>
+#include <unordered_map>
+#include <vector>
+
+namespace rolvane {
+
+// One gathering of change records from the contact database: the records of what is added to it, in that order.
+// A person that is captured several times, by itself and as a new member of groups, is read once: its records are
+// listed again, and they hold its data in encoded form. Lives for one gathering on the main thread.
+class ChangeCapture {
+public:
+    // `priorState` is user -> group -> state; a user that is met for the first time gets an empty entry in it.
+    ChangeCapture(ConduitEngine& engine, CXRolvane& rolvane, Dictionary priorState);
+
+    // The person's data for each location where it is shared, with its choices in each group that lists the person; a
+    // person that is new also enters the location's all-contacts group.
+    void addPerson(const CXRow& person, bool update);
+    void addPerson(const std::optional<CXRow>& person, bool update);
+    // What the group's location has to learn. None, and a group that is shared nowhere, add nothing.
+    void addGroup(const CXGroupRef& group);
+    // `group` is the group that the states are of, when there is one: its new members are then read together.
+    void addComparison(const Value& prior, const Value& current, const UniqueId& guid, const RemoteLocation& location,
+                       const CXGroup* group);
+    void addDistributionLists(const CXRow& person, int32_t sources, const UserName& user);
+    void add(CXDChangeRecords records);
+
+    ContactReader& reader() { return _reader; }
+    CXDChangeRecords take() { return std::move(_records); }
+
+private:
+    struct Destination {
+        UserName user;
+        int32_t sources;
+    };
+    // A person's records for one location.
+    struct Captured {
+        Destination destination;
+        CXDChangeRecords records;
+    };
+    using CapturedPerson = std::vector<Captured>;
+
+    Destination destination(const RemoteLocation& location);
+    const CapturedPerson& captured(const CXRow& person);
+    CXDChangeRecords distributionLists(const CXRow& person, const Destination& to);
+    std::optional<UniqueId> allGroupAt(const RemoteLocation& location, const UserName& user) const;
+    void addMember(const UniqueId& member);
+    void readNewMembers(const GroupSteps& steps, const CXGroup& group);
+
+    ConduitEngine& _engine;
+    ContactReader _reader;
+    Dictionary _priorState;
+    CXDChangeRecords _records;
+    std::unordered_map<RemoteLocation, Destination> _destinations;
+    std::unordered_map<UniqueId, CapturedPerson> _people; // by uniqueId
+    std::set<UniqueId> _underway;                         // groups whose comparison is under way, by uniqueId
+};
+
+} // namespace rolvane
