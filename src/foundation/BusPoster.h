@@ -12,7 +12,7 @@ namespace rolvane {
 // unless the bus does not take it: see DistributedNotifications::post.
 class BusPoster {
 public:
-    static constexpr uint64_t kMostQueued = 2000;
+    static constexpr uint64_t kMostQueued = 500;
 
     explicit BusPoster(std::optional<std::string> address); // connects
     ~BusPoster();                                           // gives what is queued a last, short chance

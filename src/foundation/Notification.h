@@ -64,10 +64,11 @@ public:
 // D-Bus signals on the session bus: path /net/rolvane/Notifications, interface net.rolvane.Notifications, member = the
 // notification's name, body a{sv} (user data; the object string, when present, under the key "object").
 // Values: boolean b, integer x, real d, string s (what is not UTF-8 is replaced), date (d), data ay, array av,
-// dictionary a{sv}, absent in an array g. Signals with another body are heard with what can be read of it. Observers
-// hear their own process's signals too; what `observe` was called for is heard from its return on. A bus that went away
-// is looked for with the next `post`, and every few seconds while anything is observed. `address` none: the session bus
-// of the environment ($DBUS_SESSION_BUS_ADDRESS, else $XDG_RUNTIME_DIR/bus), as it is now.
+// dictionary a{sv}, absent in an array g; 16 containers
+// inside one another at most, the user data counted. Signals with another body are heard with what can be read of it.
+// Observers hear their own process's signals too; what `observe` was called for is heard from its return on. A bus that
+// went away is looked for with the next `post`, and every few seconds while anything is observed. `address` none: the
+// session bus of the environment ($DBUS_SESSION_BUS_ADDRESS, else $XDG_RUNTIME_DIR/bus), as it is now.
 std::unique_ptr<DistributedNotifications> makeBusNotifications(RunLoop& loop,
                                                                std::optional<std::string> address = std::nullopt);
 

@@ -1,5 +1,9 @@
 #include "foundation/NotificationMessage.h"
 
+#include "foundation/Utf8.h"
+
+#include <algorithm>
+#include <cerrno>
 #include <cstring>
 
 namespace rolvane {
@@ -7,6 +11,10 @@ namespace rolvane {
 namespace {
 
 constexpr const char* kObjectKey = "object";
+// A bus carries 64 containers inside one another and drops the connection of who sends more; a dictionary in a variant
+// takes three.
+constexpr int kDeepest = 16;
+constexpr const char* kReplacement = "\xef\xbf\xbd"; // U+FFFD
 
 // sd-bus reports through its return values; the first failure ends the writing.
 #define RETURN_IF_NEGATIVE(expression)                                                                                 \
@@ -14,23 +22,12 @@ constexpr const char* kObjectKey = "object";
         if (int failure_ = (expression); failure_ < 0) return failure_;                                                \
     } while (false)
 
-// Length of the UTF-8 character at the beginning (RFC 3629 section 4), 0 when there is none or it is NUL.
-size_t characterLength(std::string_view text) {
-    auto byte = [&](size_t i) { return i < text.size() ? static_cast<unsigned char>(text[i]) : 0u; };
-    auto tail = [&](size_t i) { return (byte(i) & 0xc0) == 0x80; };
-    unsigned first = byte(0), second = byte(1);
-    if (first > 0 && first < 0x80) return 1;
-    if (first >= 0xc2 && first <= 0xdf) return tail(1) ? 2 : 0;
-    if (first >= 0xe0 && first <= 0xef) {
-        bool good = tail(1) && tail(2) && !(first == 0xe0 && second < 0xa0) && !(first == 0xed && second > 0x9f);
-        return good ? 3 : 0;
-    }
-    if (first >= 0xf0 && first <= 0xf4) {
-        bool good =
-            tail(1) && tail(2) && tail(3) && !(first == 0xf0 && second < 0x90) && !(first == 0xf4 && second > 0x8f);
-        return good ? 4 : 0;
-    }
-    return 0;
+bool isTooDeep(const Value& value, int deepest) {
+    auto inner = [&](const Value& v) { return isTooDeep(v, deepest - 1); };
+    if (auto* array = value.arrayIf()) return deepest == 0 || std::any_of(array->begin(), array->end(), inner);
+    auto* dictionary = value.dictionaryIf();
+    return dictionary && (deepest == 0 || std::any_of(dictionary->begin(), dictionary->end(),
+                                                      [&](const auto& entry) { return inner(entry.second); }));
 }
 
 int appendDictionary(sd_bus_message* m, const Dictionary& dictionary, const std::optional<std::string>& object);
@@ -191,14 +188,18 @@ std::string busText(std::string_view text) {
     std::string out;
     out.reserve(text.size());
     while (!text.empty()) {
-        size_t length = characterLength(text);
-        out += length ? text.substr(0, length) : std::string_view("\xef\xbf\xbd");
-        text.remove_prefix(std::max<size_t>(length, 1));
+        if (auto character = takeCodePoint(text); character && *character != 0)
+            appendUtf8(*character, out);
+        else {
+            out += kReplacement;
+            if (!character) text.remove_prefix(1);
+        }
     }
     return out;
 }
 
 int makeNotificationMessage(sd_bus* bus, const Notification& notification, BusMessage& message) {
+    if (isTooDeep(notification.userInfo, kDeepest)) return -EMSGSIZE;
     sd_bus_message* made = nullptr;
     int result =
         sd_bus_message_new_signal(bus, &made, kNotificationPath, kNotificationInterface, notification.name.c_str());

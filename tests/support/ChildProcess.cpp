@@ -11,8 +11,8 @@
 #include <fcntl.h>
 #include <poll.h>
 #include <sys/eventfd.h>
-#include <sys/pidfd.h>
 #include <sys/prctl.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -93,7 +93,7 @@ void ChildProcess::start(const Options& options) {
         throw std::runtime_error("cannot start " + options.arguments.at(0) + ": " +
                                  std::strerror(error ? error : errno));
     }
-    _pidDescriptor = ::pidfd_open(_pid, 0);
+    _pidDescriptor = static_cast<int>(::syscall(SYS_pidfd_open, _pid, 0));
     _control = ::eventfd(0, EFD_CLOEXEC);
     for (int fd : {_out.fd, _err.fd}) ::fcntl(fd, F_SETFL, O_NONBLOCK);
     _reader = std::thread([this] { readOutput(); });
