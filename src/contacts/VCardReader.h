@@ -1,0 +1,47 @@
+#pragma once
+
+#include "contacts/VCardScanner.h"
+#include "foundation/Value.h"
+
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace rolvane {
+
+// Which of a member's values a group uses: an entry of the member's multi-value property, named by its label and its
+// text, because identifiers of entries belong to one database.
+struct VCardChoice {
+    std::string member;   // UID text
+    std::string property; // kCXEmailProperty
+    std::string label;
+    std::string raw; // as vcardEncodeMultiValue writes the value
+
+    friend bool operator==(const VCardChoice&, const VCardChoice&) = default;
+};
+
+// What a card says. For a person `properties` are those of CXPerson, multi-values in their Value form with fresh
+// identifiers; names of CATEGORIES are in `categories`, not among the properties. For a group they are those of
+// CXGroup, and the four lists say who is in it.
+//
+// What a person's dictionary has no place for is kept under kCXVCardExtraProperty, sorted:
+// - a content line, unfolded, is written again as it stands ("X-COLOUR:red", "UID:…" of a card whose UID is no UUID);
+// - a content line behind "+" carries parameters and the group of a line that the dictionary does express
+//   ("+TEL;TYPE=car;PREF=1;X-ROLVANE-LABEL=Car:+44 1"); it is used as long as that value and label are there.
+struct VCardEntity {
+    bool isGroup = false;
+    std::string uid; // UID text as in the card, "" for none
+    Dictionary properties;
+    std::vector<std::string> categories;
+    std::vector<std::string> members, subgroups; // UID texts
+    std::vector<VCardChoice> choices;
+    size_t line = 0; // of the card's beginning
+};
+
+// Reads a scanned card. Nothing when it is a bad one; `error` then has line and reason. Pure; any thread.
+std::optional<VCardEntity> vcardEntityFromCard(const VCard& card, VCardError& error);
+
+// The UID text of a record identifier ("urn:uuid:<UUID>") and the UUID part of the record for a UID text.
+std::string vcardUIDForUUID(std::string_view uuid);
+
+} // namespace rolvane
