@@ -15,8 +15,10 @@ CXMultiValue united(const CXMultiValue& own, const CXMultiValue& imported) {
         while (i < own.count() &&
                (answered[i] || own.labelAtIndex(i) != entry.label || own.valueAtIndex(i) != entry.value))
             i++;
-        if (i < own.count()) answered[i] = true;
-        else all.addValue(entry.value.deepMutableCopy(), entry.label, entry.identifier);
+        if (i < own.count())
+            answered[i] = true;
+        else
+            all.addValue(entry.value.deepMutableCopy(), entry.label, entry.identifier);
     }
     return all;
 }
@@ -31,7 +33,8 @@ Value mergedValue(const Value& own, const Value& imported) {
     auto ownMulti = CXMultiValue::fromValue(own), importedMulti = CXMultiValue::fromValue(imported);
     if (ownMulti && importedMulti) return united(*ownMulti, *importedMulti).toValue();
     if (ownMulti) return own; // a multi-value is not lost to something of another kind
-    if (isListOfStrings(own) && isListOfStrings(imported)) return cxArrayCombinedWithArray(own.array(), imported.array());
+    if (isListOfStrings(own) && isListOfStrings(imported))
+        return cxArrayCombinedWithArray(own.array(), imported.array());
     return imported.deepMutableCopy();
 }
 
@@ -41,13 +44,6 @@ Dictionary CXMerger::merged(const Dictionary& card, const Dictionary& importedCa
     Dictionary result = Value(card).deepMutableCopy().dictionary();
     for (const auto& [key, value] : importedCard) result.set(key, mergedValue(result[key], value));
     return result;
-}
-
-void CXMerger::updateCard(CXPerson& card, const CXPerson& importedCard) const {
-    Dictionary own = card.dictionaryRepresentation();
-    Dictionary result = merged(own, importedCard.dictionaryRepresentation());
-    for (const auto& [key, value] : result)
-        if (own[key] != value) card.setValue(value, key);
 }
 
 } // namespace rolvane

@@ -26,14 +26,16 @@ constexpr std::array<VCardMultiField, 7> kMultiFields{{
 
 constexpr std::string_view kOwnPrefix = "X-ROLVANE-";
 
-constexpr std::array<const char*, 7> kAddressKeys{kCXAddressPOBoxKey, kCXAddressExtendedKey, kCXAddressStreetKey,
-                                                  kCXAddressCityKey,  kCXAddressStateKey,    kCXAddressZIPKey,
+constexpr std::array<const char*, 7> kAddressKeys{kCXAddressPOBoxKey,  kCXAddressExtendedKey, kCXAddressStreetKey,
+                                                  kCXAddressCityKey,   kCXAddressStateKey,    kCXAddressZIPKey,
                                                   kCXAddressCountryKey};
 
 constexpr std::array<const char*, 5> kNameKeys{kCXLastNameProperty, kCXFirstNameProperty, kCXMiddleNameProperty,
                                                kCXTitleProperty, kCXSuffixProperty};
 
-bool isURIField(std::string_view property) { return property == kCXURLsProperty || property == kCXInstantMessageProperty; }
+bool isURIField(std::string_view property) {
+    return property == kCXURLsProperty || property == kCXInstantMessageProperty;
+}
 
 Value decodeAddress(const VCardLine& line) {
     Dictionary address;
@@ -56,7 +58,8 @@ std::optional<std::string> encodeAddress(const Value& value) {
         if (i > 0) raw += ';';
         const Value& part = (*address)[kAddressKeys[i]];
         if (!part) continue;
-        if (!part.isString() || vcardTrim(part.string()).empty() || !vcardIsPlainText(part.string())) return std::nullopt;
+        if (!part.isString() || vcardTrim(part.string()).empty() || !vcardIsPlainText(part.string()))
+            return std::nullopt;
         raw += vcardEscape(part.string());
         used++;
     }
@@ -100,8 +103,10 @@ int number(std::string_view s) {
 // "1985-04-12" or "19850412"; nothing for anything else and for days that no month has.
 std::optional<std::chrono::sys_days> decodeDay(std::string_view t) {
     std::string plain;
-    if (t.size() == 10 && t[4] == '-' && t[7] == '-') plain = std::string(t.substr(0, 4)) += std::string(t.substr(5, 2)) += t.substr(8);
-    else plain = std::string(t);
+    if (t.size() == 10 && t[4] == '-' && t[7] == '-')
+        plain = std::string(t.substr(0, 4)) += std::string(t.substr(5, 2)) += t.substr(8);
+    else
+        plain = std::string(t);
     if (plain.size() != 8 || !digits(plain)) return std::nullopt;
     std::string_view p = plain;
     std::chrono::year_month_day day{std::chrono::year(number(p.substr(0, 4))),
@@ -116,8 +121,10 @@ std::optional<int> decodeTime(std::string_view t) {
     if (!t.ends_with('Z')) return std::nullopt;
     t.remove_suffix(1);
     std::string plain;
-    if (t.size() == 8 && t[2] == ':' && t[5] == ':') plain = std::string(t.substr(0, 2)) += std::string(t.substr(3, 2)) += t.substr(6);
-    else plain = std::string(t);
+    if (t.size() == 8 && t[2] == ':' && t[5] == ':')
+        plain = std::string(t.substr(0, 2)) += std::string(t.substr(3, 2)) += t.substr(6);
+    else
+        plain = std::string(t);
     if (plain.size() != 6 || !digits(plain)) return std::nullopt;
     std::string_view p = plain;
     int h = number(p.substr(0, 2)), m = number(p.substr(2, 2)), s = number(p.substr(4, 2));
@@ -143,7 +150,8 @@ std::optional<VCardPhoto> decodeDataURI(const std::string& uri, std::string& rea
     VCardPhoto photo;
     photo.mediaType = vcardLower(head.substr(0, head.find(';')));
     if (vcardLower(head).ends_with(";base64")) {
-        auto bytes = vcardDecodeBase64(data.find('%') == std::string_view::npos ? std::string(data) : vcardDecodePercent(data));
+        auto bytes =
+            vcardDecodeBase64(data.find('%') == std::string_view::npos ? std::string(data) : vcardDecodePercent(data));
         if (!bytes) {
             reason = "the photo's base64 is damaged";
             return std::nullopt;
@@ -157,13 +165,16 @@ std::optional<VCardPhoto> decodeDataURI(const std::string& uri, std::string& rea
 }
 
 bool startsWith(const Bytes& bytes, std::string_view magic, size_t at = 0) {
-    return bytes.size() >= at + magic.size() && std::equal(magic.begin(), magic.end(), bytes.begin() + static_cast<long>(at),
-                                                           [](char a, uint8_t b) { return static_cast<uint8_t>(a) == b; });
+    return bytes.size() >= at + magic.size() &&
+           std::equal(magic.begin(), magic.end(), bytes.begin() + static_cast<long>(at),
+                      [](char a, uint8_t b) { return static_cast<uint8_t>(a) == b; });
 }
 
 std::string firstValueOf(const Dictionary& person, std::string_view property) {
-    const Array* values = person[property].dictionaryIf() ? (*person[property].dictionaryIf())["values"].arrayIf() : nullptr;
-    return values && !values->empty() && vcardIsPlainText((*values)[0].string()) ? (*values)[0].string() : std::string();
+    const Array* values =
+        person[property].dictionaryIf() ? (*person[property].dictionaryIf())["values"].arrayIf() : nullptr;
+    return values && !values->empty() && vcardIsPlainText((*values)[0].string()) ? (*values)[0].string()
+                                                                                 : std::string();
 }
 
 } // namespace
@@ -176,7 +187,8 @@ const VCardMultiField* vcardMultiFieldForLine(std::string_view lineName, bool la
         bool suffixed = *f.xSuffix && lineName.starts_with("X-") && lineName.ends_with(f.xSuffix);
         if (labelled && suffixed) return &f;
     }
-    if (lineName == "ANNIVERSARY" || lineName == "X-ANNIVERSARY") return vcardMultiFieldForProperty(kCXOtherDatesProperty);
+    if (lineName == "ANNIVERSARY" || lineName == "X-ANNIVERSARY")
+        return vcardMultiFieldForProperty(kCXOtherDatesProperty);
     return nullptr;
 }
 
@@ -222,9 +234,12 @@ std::optional<std::string> vcardEncodeMultiValue(std::string_view property, cons
 std::string vcardEncodeURI(std::string_view text) {
     std::string out;
     for (char c : text) {
-        if (c == '\\') out += "\\\\";
-        else if (c == '\n') out += "\\n";
-        else out += c;
+        if (c == '\\')
+            out += "\\\\";
+        else if (c == '\n')
+            out += "\\n";
+        else
+            out += c;
     }
     return out;
 }
@@ -317,10 +332,10 @@ std::string vcardEncodeDate(Date date, bool version4) {
 }
 
 bool vcardIsTruncatedDate(std::string_view t) {
-    if (t.size() == 4) return digits(t);                                                              // 1985
-    if (t.size() == 7) return digits(t.substr(0, 4)) && t[4] == '-' && digits(t.substr(5));           // 1985-04
-    if (t.size() == 6) return t.starts_with("--") && digits(t.substr(2));                             // --0412
-    return t.size() == 5 && t.starts_with("---") && digits(t.substr(3));                              // ---12
+    if (t.size() == 4) return digits(t);                                                    // 1985
+    if (t.size() == 7) return digits(t.substr(0, 4)) && t[4] == '-' && digits(t.substr(5)); // 1985-04
+    if (t.size() == 6) return t.starts_with("--") && digits(t.substr(2));                   // --0412
+    return t.size() == 5 && t.starts_with("---") && digits(t.substr(3));                    // ---12
 }
 
 std::optional<VCardPhoto> vcardDecodePhoto(const VCardLine& line, std::string& reason) {
@@ -331,10 +346,13 @@ std::optional<VCardPhoto> vcardDecodePhoto(const VCardLine& line, std::string& r
         photo = decodeDataURI(vcardUnescape(line.value), reason);
     } else if (inlined) {
         auto bytes = vcardDecodeBase64(line.value);
-        if (!bytes) reason = "the photo's base64 is damaged";
-        else photo = VCardPhoto{std::move(*bytes), {}};
+        if (!bytes)
+            reason = "the photo's base64 is damaged";
+        else
+            photo = VCardPhoto{std::move(*bytes), {}};
         for (const auto& type : line.types())
-            if (photo && photo->mediaType.empty() && !type.empty() && type != "pref") photo->mediaType = mediaTypeOfWord(type);
+            if (photo && photo->mediaType.empty() && !type.empty() && type != "pref")
+                photo->mediaType = mediaTypeOfWord(type);
     }
     if (photo && photo->mediaType.empty()) photo->mediaType = vcardSniffMediaType(photo->bytes);
     return photo;
@@ -367,7 +385,8 @@ std::string vcardDerivedFormattedName(const Dictionary& person) {
     std::string organization = textOf(person, kCXOrganizationProperty);
     if (person[kCXIsCompanyProperty].boolean() && !organization.empty()) return organization;
     std::string name;
-    for (const char* key : {kCXTitleProperty, kCXFirstNameProperty, kCXMiddleNameProperty, kCXLastNameProperty, kCXSuffixProperty}) {
+    for (const char* key :
+         {kCXTitleProperty, kCXFirstNameProperty, kCXMiddleNameProperty, kCXLastNameProperty, kCXSuffixProperty}) {
         std::string part = textOf(person, key);
         if (!part.empty()) (name += name.empty() ? "" : " ") += part;
     }

@@ -11,7 +11,7 @@ namespace rolvane {
 namespace {
 
 struct Mapping {
-    std::string_view name;  // content line, "" for any
+    std::string_view name; // content line, "" for any
     std::string_view label;
     std::string_view types[2]; // all of them must be there; the second may be ""
 };
@@ -67,8 +67,10 @@ std::vector<std::string> vcardTypesForLabel(std::string_view name, std::string_v
     for (const auto& m : kMappings) {
         if ((!m.name.empty() && m.name != name) || m.label != label) continue;
         std::vector<std::string> types{std::string(m.types[0])};
-        if (!m.types[1].empty()) types.emplace_back(m.types[1]);
-        else if (name == "TEL" && (label == kCXHomeLabel || label == kCXWorkLabel)) types.emplace_back("voice");
+        if (!m.types[1].empty())
+            types.emplace_back(m.types[1]);
+        else if (name == "TEL" && (label == kCXHomeLabel || label == kCXWorkLabel))
+            types.emplace_back("voice");
         return types;
     }
     return {};

@@ -77,7 +77,8 @@ public:
         finishNames();
         if (_entity.isGroup && !_entity.properties[kCXGroupNameProperty])
             return bad(_card.firstLine, "the group has no name (FN)");
-        bool nothing = _entity.properties.empty() && _extras.empty() && _entity.categories.empty() && _entity.uid.empty();
+        bool nothing =
+            _entity.properties.empty() && _extras.empty() && _entity.categories.empty() && _entity.uid.empty();
         if (nothing) return bad(_card.firstLine, "the card is empty");
         storeExtras();
         return std::move(_entity);
@@ -99,8 +100,10 @@ private:
     // Custom labels, how many lines a group name holds together, and whether this is a group's card.
     void studyGroups() {
         for (const auto& line : _card.lines) {
-            if (isLabelLine(line)) _labels.emplace(line.group, vcardUnescape(line.value));
-            else if (!line.group.empty()) _groupUse[line.group]++;
+            if (isLabelLine(line))
+                _labels.emplace(line.group, vcardUnescape(line.value));
+            else if (!line.group.empty())
+                _groupUse[line.group]++;
             if (isKindLine(line) && vcardEqualNoCase(vcardTrim(line.value), "group")) _entity.isGroup = true;
         }
     }
@@ -133,13 +136,16 @@ private:
 
     bool takeKind(const VCardLine& line) {
         std::string kind = vcardLower(vcardTrim(line.value));
-        if (kind == "org" || kind == "organization") _entity.properties.set(kCXIsCompanyProperty, true);
-        else if (kind != "group" && kind != "individual") keep(line);
+        if (kind == "org" || kind == "organization")
+            _entity.properties.set(kCXIsCompanyProperty, true);
+        else if (kind != "group" && kind != "individual")
+            keep(line);
         return true;
     }
 
     bool takeOfGroup(const VCardLine& line) {
-        if (line.name == "X-ROLVANE-SUBGROUP") return _entity.subgroups.emplace_back(vcardTrim(vcardUnescape(line.value))), true;
+        if (line.name == "X-ROLVANE-SUBGROUP")
+            return _entity.subgroups.emplace_back(vcardTrim(vcardUnescape(line.value))), true;
         if (isMemberLine(line)) return _entity.members.emplace_back(vcardTrim(vcardUnescape(line.value))), true;
         if (line.name == "X-ROLVANE-CHOICE") {
             _entity.choices.push_back({line.firstValueOf("X-MEMBER"), line.firstValueOf("X-PROPERTY"),
@@ -148,7 +154,8 @@ private:
         }
         bool names = line.name == "FN" || (line.name == "N" && !_entity.properties[kCXGroupNameProperty]);
         if (!names) return line.name == "N";
-        std::string name = line.name == "FN" ? vcardUnescape(line.value) : vcardUnescape(vcardSplit(line.value, ';')[0]);
+        std::string name =
+            line.name == "FN" ? vcardUnescape(line.value) : vcardUnescape(vcardSplit(line.value, ';')[0]);
         if (!vcardTrim(name).empty()) _entity.properties.set(kCXGroupNameProperty, name);
         return true;
     }
@@ -179,9 +186,9 @@ private:
         }
         Value value = vcardDecodeMultiValue(field->property, line);
         if (!value) return vcardTrim(line.value).empty();
-        std::string label = labelled                              ? custom->second
+        std::string label = labelled                             ? custom->second
                             : line.name.ends_with("ANNIVERSARY") ? kCXAnniversaryLabel
-                                                                  : vcardLabelForTypes(field->lineName, line.types());
+                                                                 : vcardLabelForTypes(field->lineName, line.types());
         carry(line, *field, label, value);
         _multi[field->property].push_back({preferenceOf(line), std::move(label), std::move(value)});
         return true;
@@ -198,7 +205,8 @@ private:
             if (t != "pref" && !t.empty()) carrier.add("TYPE", t);
         for (const auto& p : line.parameters) {
             bool said = p.name == "TYPE" || p.name == "VALUE" || p.name == "ENCODING" || p.name == "PREF" ||
-                        p.name == "X-ROLVANE-LABEL" || (p.name == "CC" && field.property == std::string_view(kCXAddressProperty));
+                        p.name == "X-ROLVANE-LABEL" ||
+                        (p.name == "CC" && field.property == std::string_view(kCXAddressProperty));
             if (said) continue;
             carrier.parameters.push_back(p);
             needed = true;
@@ -254,8 +262,10 @@ private:
         if (empty) return true;
         bool isText = vcardEqualNoCase(line.firstValueOf("VALUE"), "text");
         auto date = isText ? std::nullopt : vcardDecodeDate(line.value);
-        if (date) _entity.properties.set(kCXBirthdayProperty, *date);
-        else _entity.properties.set(kCXBirthdayTextProperty, vcardUnescape(line.value));
+        if (date)
+            _entity.properties.set(kCXBirthdayProperty, *date);
+        else
+            _entity.properties.set(kCXBirthdayTextProperty, vcardUnescape(line.value));
         return true;
     }
 
@@ -352,8 +362,12 @@ private:
 
 } // namespace
 
-std::optional<VCardEntity> vcardEntityFromCard(const VCard& card, VCardError& error) { return Reader(card, error).read(); }
+std::optional<VCardEntity> vcardEntityFromCard(const VCard& card, VCardError& error) {
+    return Reader(card, error).read();
+}
 
-std::string vcardUIDForUUID(std::string_view uuid) { return "urn:uuid:" + std::string(uuid); }
+std::string vcardUIDForUUID(std::string_view uuid) {
+    return "urn:uuid:" + std::string(uuid);
+}
 
 } // namespace rolvane

@@ -15,8 +15,9 @@ namespace rolvane {
 namespace {
 
 // In the order in which a person expects to see them.
-constexpr const char* kMultiOrder[] = {kCXPhoneProperty,          kCXEmailProperty,        kCXAddressProperty, kCXURLsProperty,
-                                       kCXInstantMessageProperty, kCXRelatedNamesProperty, kCXOtherDatesProperty};
+constexpr const char* kMultiOrder[] = {kCXPhoneProperty,     kCXEmailProperty,          kCXAddressProperty,
+                                       kCXURLsProperty,      kCXInstantMessageProperty, kCXRelatedNamesProperty,
+                                       kCXOtherDatesProperty};
 
 constexpr std::pair<const char*, const char*> kTextLines[] = {
     {"TITLE", kCXJobTitleProperty},
@@ -29,8 +30,9 @@ constexpr std::pair<const char*, const char*> kTextLines[] = {
 
 // Never compared, because they are written by rules of their own, or never written at all.
 bool isOutsideTheCheck(std::string_view property) {
-    for (auto p : {kCXVCardExtraProperty, kCXCategoriesProperty, kCXRemoteLocationProperty, kCXReadSharingACLProperty,
-                   kCXReadWriteSharingACLProperty, kCXUIDProperty, kCXCreationDateProperty, kCXModificationDateProperty})
+    for (auto p :
+         {kCXVCardExtraProperty, kCXCategoriesProperty, kCXRemoteLocationProperty, kCXReadSharingACLProperty,
+          kCXReadWriteSharingACLProperty, kCXUIDProperty, kCXCreationDateProperty, kCXModificationDateProperty})
         if (property == p) return true;
     return false;
 }
@@ -47,8 +49,10 @@ public:
 
     std::string text() {
         readExtras();
-        if (_entity.isGroup) writeGroup();
-        else writePerson();
+        if (_entity.isGroup)
+            writeGroup();
+        else
+            writePerson();
         for (const auto& line : _plain) emit(line);
         writeInexact();
         std::string out = "BEGIN:VCARD\r\nVERSION:";
@@ -131,7 +135,8 @@ private:
         names.insert(names.end(), _entity.categories.begin(), _entity.categories.end());
         std::vector<std::string> once;
         for (const auto& n : names)
-            if (!n.empty() && vcardIsPlainText(n) && std::find(once.begin(), once.end(), n) == once.end()) once.push_back(n);
+            if (!n.empty() && vcardIsPlainText(n) && std::find(once.begin(), once.end(), n) == once.end())
+                once.push_back(n);
         if (!once.empty()) emit("CATEGORIES", vcardEncodeList(once));
     }
 
@@ -249,7 +254,8 @@ private:
 
     // PREF=1 of 4.0 is TYPE=pref in 3.0. A preference that contradicts the order is not written.
     void placePreference(VCardLine& line, int& preference) const {
-        auto p = std::find_if(line.parameters.begin(), line.parameters.end(), [](const auto& q) { return q.name == "PREF"; });
+        auto p = std::find_if(line.parameters.begin(), line.parameters.end(),
+                              [](const auto& q) { return q.name == "PREF"; });
         int own = p == line.parameters.end() || p->values.empty() ? 1000 : std::atoi(p->values.front().c_str());
         bool fits = own >= preference;
         preference = fits ? own : 1000;
@@ -323,6 +329,8 @@ private:
 
 } // namespace
 
-std::string vcardText(const VCardEntity& entity, VCardVersion version) { return Writer(entity, version).text(); }
+std::string vcardText(const VCardEntity& entity, VCardVersion version) {
+    return Writer(entity, version).text();
+}
 
 } // namespace rolvane
