@@ -388,7 +388,9 @@ TEST(PrivateStore, IsNotDeceivedByTheProcessNumberOfADeadStore) {
     const StoreDirectory directory;
     PrivateStore store(optionsIn(directory));
     store.start();
-    kill(-store.status().pid, SIGKILL);
+    const pid_t master = store.status().pid;
+    kill(-master, SIGKILL);
+    waitpid(master, nullptr, 0);
     // The number now belongs to this very program.
     writeFileDurably(directory.path("store/run/httpd.pid"), std::to_string(getpid()) + "\n");
     EXPECT_FALSE(store.status().running);
@@ -403,7 +405,9 @@ TEST(PrivateStore, TakesOverFromTheWorkersOfAMasterThatWasKilled) {
     const StoreDirectory directory;
     PrivateStore store(optionsIn(directory));
     store.start();
-    kill(store.status().pid, SIGKILL); // its workers go on and hold the port
+    const pid_t master = store.status().pid;
+    kill(master, SIGKILL); // its workers go on and hold the port
+    waitpid(master, nullptr, 0);
     store.start();
     EXPECT_TRUE(store.status().running);
 }
