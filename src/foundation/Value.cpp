@@ -114,7 +114,7 @@ void Array::removeAt(size_t index) {
 }
 
 void Array::removeAll(const Value& v) {
-    const Value wanted = v; // v may live inside this array
+    const Value wanted = v; // NOLINT(performance-unnecessary-copy-initialization): v may live inside this array
     if (!contains(wanted)) return;
     std::erase(_p->items, wanted);
     const std::string* s = wanted.stringIf();

@@ -1,0 +1,77 @@
+# The commands of this project. Everything is built under build/<preset>; nothing is installed but by `setup` (packages
+# of the distribution) and `install`.
+#
+#   make demo      see the whole thing work, on real parts
+#   make test      build what is released and run every test
+
+JOBS   ?= $(shell nproc)
+PREFIX ?= /usr/local
+TESTS  ?=
+CTEST   = ctest -j$(JOBS) --no-tests=error --output-on-failure $(if $(TESTS),-R '$(TESTS)')
+
+.DEFAULT_GOAL := help
+.PHONY: help setup build demo test asan tsan fuzz bench lint format install deb clean
+
+help:
+	@echo 'make demo              set up, build, and show the main job on a private store'
+	@echo 'make test              set up, build (release) and run every test; TESTS=regex runs some'
+	@echo 'make asan, make tsan   the same tests under AddressSanitizer+UBSan, or ThreadSanitizer'
+	@echo 'make fuzz              every fuzz target for SECONDS_EACH seconds (60)'
+	@echo 'make bench             benchmarks, with the ratios to independent clients'
+	@echo 'make lint              formatting, room order, clang-tidy; make format mends the first'
+	@echo 'make build             only build (release)'
+	@echo 'make install           install under PREFIX (/usr/local), DESTDIR is honoured'
+	@echo 'make deb               a Debian package in build/release'
+	@echo 'make setup             install the Debian packages that building and testing need'
+	@echo 'make clean             remove build/'
+
+setup:
+	@packaging/setup build test
+
+build: setup
+	cmake --preset release
+	cmake --build --preset release -j$(JOBS)
+
+demo: build
+	demo/run build/release
+
+test: build
+	cd build/release && $(CTEST)
+
+asan tsan: setup
+	cmake --preset $@
+	cmake --build --preset $@ -j$(JOBS)
+	cd build/$@ && $(CTEST)
+
+SECONDS_EACH ?= 60
+fuzz:
+	@packaging/setup build fuzz
+	cmake --preset fuzz
+	cmake --build --preset fuzz -j$(JOBS)
+	fuzz/run build/fuzz $(SECONDS_EACH)
+
+bench:
+	@packaging/setup build test bench
+	cmake --preset bench
+	cmake --build --preset bench -j$(JOBS)
+	bench/run build/bench
+
+lint:
+	@packaging/setup build test lint
+	cmake --preset release
+	packaging/lint/run build/release
+
+format:
+	@packaging/setup lint
+	git ls-files -- '*.h' '*.cpp' | xargs clang-format -i
+
+# Does not build, so that `sudo make install` leaves no files of root in the tree.
+install:
+	@test -f build/release/build.ninja || { echo 'make install: nothing is built yet. Run "make build" first.' >&2; exit 1; }
+	cmake --install build/release --prefix '$(PREFIX)'
+
+deb: build
+	cd build/release && cpack -G DEB
+
+clean:
+	rm -rf build
