@@ -188,12 +188,17 @@ std::string busText(std::string_view text) {
     std::string out;
     out.reserve(text.size());
     while (!text.empty()) {
-        if (auto character = takeCodePoint(text); character && *character != 0)
+        size_t plain = 0; // ASCII but NUL
+        while (plain < text.size() && text[plain] > 0 && static_cast<unsigned char>(text[plain]) < 0x80) ++plain;
+        out += text.substr(0, plain);
+        text.remove_prefix(plain);
+        if (text.empty()) break;
+        auto character = takeCodePoint(text);
+        if (character && *character != 0)
             appendUtf8(*character, out);
-        else {
+        else
             out += kReplacement;
-            if (!character) text.remove_prefix(1);
-        }
+        if (!character) text.remove_prefix(1);
     }
     return out;
 }

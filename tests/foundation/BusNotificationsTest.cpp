@@ -336,7 +336,7 @@ TEST_F(Bus, ABusThatHangsHoldsUpPostersForAMomentOnlyAndGetsWhatWasQueuedLater) 
     auto listening = other->observe(
         "Progress", [&](const Notification&) { ++got; }, false);
     bus.pause();
-    std::string padding(30000, 'x');
+    Bytes padding(30'000);
     double took = secondsOf([&] {
         while (accepted < 100'000 && center->post({"Progress", {}, {{"padding", padding}}})) ++accepted;
         for (int i = 0; i < 1000; ++i) EXPECT_FALSE(center->post({"Progress", {}, {{"padding", padding}}}));
