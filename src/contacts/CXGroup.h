@@ -47,7 +47,7 @@ public:
     // Which value of the person's multi-value property this group uses; nothing when it holds no choice.
     std::optional<std::string> distributionIdentifierForProperty(std::string_view property,
                                                                  const CXPersonRef& person) const;
-    // Nothing clears the choice. The person need not be a member (yet).
+    // Nothing clears the choice. The person need not be a member (yet). All-contacts groups hold no choices.
     void setDistributionIdentifier(const std::optional<std::string>& identifier, std::string_view property,
                                    const CXPersonRef& person);
     // Of the whole group in one query: the person's `uniqueId` -> choices. Only choices for properties that the person

@@ -1,0 +1,203 @@
+#include "contacts/CXGroup.h"
+
+#include "contacts/RolvaneImpl.h"
+
+#include <algorithm>
+
+namespace rolvane {
+
+namespace {
+
+std::vector<UniqueId> sharing(std::vector<UniqueId> uids) {
+    for (UniqueId& uid : uids) uid = cxNormalizedUID(uid);
+    return uids;
+}
+
+// Is `wanted` the group or below it?
+bool holds(CXRolvane::Impl& d, const UniqueId& group, const UniqueId& wanted, std::set<UniqueId>& seen) {
+    if (group == wanted) return true;
+    if (!seen.insert(group).second) return false;
+    std::vector<UniqueId> below = d.listed(group, true);
+    return std::any_of(below.begin(), below.end(), [&](const UniqueId& g) { return holds(d, g, wanted, seen); });
+}
+
+CXSearchElement element(std::string_view table, std::string_view property, std::string_view label, std::string_view key,
+                        Value value, int comparison) {
+    return {std::string(table), std::string(property), std::string(label),
+            std::string(key),   std::move(value),      static_cast<CXSearchComparison>(comparison)};
+}
+
+// The database that holds both, or an exception.
+CXRolvane& databaseOfBoth(const CXGroup& group, const CXRecordRef& other) {
+    CXRolvane* database = group.rolvane();
+    if (!other) throw CXException(kCXInvalidArgumentException, "There is no record to list in " + group.name() + ".");
+    if (!database || other->rolvane() != database || !group.isAttached() || !other->isAttached())
+        throw CXException(kCXInvalidArgumentException, group.uniqueId().str() + " cannot list " +
+                                                           other->uniqueId().str() +
+                                                           ": both must have been added to the same database.");
+    return *database;
+}
+
+} // namespace
+
+CXGroupRef CXGroup::create() {
+    return initWithUniqueId(makeUniqueId(kCXGroupTable));
+}
+
+CXGroupRef CXGroup::initWithUniqueId(const UniqueId& uid) {
+    if (cxTableName(uid) == kCXSubscribedGroupTable) return CXSubscribedGroup::initWithUniqueId(uid);
+    return CXGroupRef(new CXGroup(uid, Dictionary{{kCXGroupNameProperty, defaultGroupName(RecordKind::group)}}));
+}
+
+CXGroupRef CXSubscribedGroup::initWithUniqueId(const UniqueId& uid) {
+    return CXGroupRef(
+        new CXSubscribedGroup(uid, Dictionary{{kCXGroupNameProperty, defaultGroupName(RecordKind::subscribedGroup)}}));
+}
+
+CXSearchElement CXGroup::searchElementForProperty(std::string_view property, std::string_view label,
+                                                  std::string_view key, Value value, int comparison) {
+    return element(kCXGroupTable, property, label, key, std::move(value), comparison);
+}
+
+CXSearchElement CXSubscribedGroup::searchElementForProperty(std::string_view property, std::string_view label,
+                                                            std::string_view key, Value value, int comparison) {
+    return element(kCXSubscribedGroupTable, property, label, key, std::move(value), comparison);
+}
+
+std::string CXGroup::name() const {
+    return valueForProperty(kCXGroupNameProperty).string();
+}
+
+std::vector<UniqueId> CXGroup::memberUniqueIds() const {
+    CXRolvane* database = owner();
+    if (!database) return {};
+    std::lock_guard lock(database->impl().mutex);
+    return database->impl().listed(uniqueId(), false);
+}
+
+std::vector<UniqueId> CXGroup::subgroupUniqueIds() const {
+    CXRolvane* database = owner();
+    if (!database) return {};
+    std::lock_guard lock(database->impl().mutex);
+    return database->impl().listed(uniqueId(), true);
+}
+
+std::vector<UniqueId> CXGroup::memberIdentifiers() const {
+    return sharing(memberUniqueIds());
+}
+std::vector<UniqueId> CXGroup::subgroupIdentifiers() const {
+    return sharing(subgroupUniqueIds());
+}
+
+size_t CXGroup::memberCount() const {
+    CXRolvane* database = owner();
+    if (!database) return 0;
+    std::lock_guard lock(database->impl().mutex);
+    if (!database->impl().work.empty()) return memberUniqueIds().size();
+    return static_cast<size_t>(database->impl().store.countMembers(uniqueId()));
+}
+
+std::vector<CXPersonRef> CXGroup::members() const {
+    CXRolvane* database = owner();
+    if (!database) return {};
+    std::lock_guard lock(database->impl().mutex);
+    std::vector<CXPersonRef> people;
+    for (const UniqueId& uid : memberUniqueIds())
+        if (auto person = database->impl().handleAs<CXPerson>(uid)) people.push_back(person);
+    return people;
+}
+
+std::vector<CXGroupRef> CXGroup::subgroups() const {
+    CXRolvane* database = owner();
+    if (!database) return {};
+    std::lock_guard lock(database->impl().mutex);
+    std::vector<CXGroupRef> groups;
+    for (const UniqueId& uid : subgroupUniqueIds())
+        if (auto group = database->impl().handleAs<CXGroup>(uid)) groups.push_back(group);
+    return groups;
+}
+
+bool CXGroup::addMember(const CXPersonRef& person) {
+    CXRolvane& database = databaseOfBoth(*this, person);
+    std::lock_guard lock(database.impl().mutex);
+    return database.impl().list(uniqueId(), person->uniqueId());
+}
+
+bool CXGroup::removeMember(const CXPersonRef& person) {
+    CXRolvane& database = databaseOfBoth(*this, person);
+    std::lock_guard lock(database.impl().mutex);
+    return database.impl().unlist(uniqueId(), person->uniqueId());
+}
+
+bool CXGroup::addSubgroup(const CXGroupRef& group) {
+    CXRolvane& database = databaseOfBoth(*this, group);
+    std::lock_guard lock(database.impl().mutex);
+    if (group->isAllGroup())
+        throw CXException(kCXInvalidArgumentException, "An all-contacts group cannot be a subgroup of " + name() + ".");
+    std::set<UniqueId> seen;
+    if (holds(database.impl(), group->uniqueId(), uniqueId(), seen))
+        throw CXException(kCXInvalidArgumentException, "The group \"" + group->name() +
+                                                           "\" cannot become a subgroup of \"" + name() +
+                                                           "\": it would contain itself.");
+    return database.impl().list(uniqueId(), group->uniqueId());
+}
+
+bool CXGroup::removeSubgroup(const CXGroupRef& group) {
+    CXRolvane& database = databaseOfBoth(*this, group);
+    std::lock_guard lock(database.impl().mutex);
+    return database.impl().unlist(uniqueId(), group->uniqueId());
+}
+
+std::vector<CXGroupRef> CXGroup::parentGroups() const {
+    CXRolvane* database = owner();
+    if (!database) return {};
+    std::lock_guard lock(database->impl().mutex);
+    std::vector<CXGroupRef> groups;
+    for (const UniqueId& uid : database->impl().parents(uniqueId()))
+        if (auto group = database->impl().handleAs<CXGroup>(uid)) groups.push_back(group);
+    return groups;
+}
+
+std::optional<std::string> CXGroup::distributionIdentifierForProperty(std::string_view property,
+                                                                      const CXPersonRef& person) const {
+    CXRolvane* database = owner();
+    if (!database || !person) return std::nullopt;
+    std::lock_guard lock(database->impl().mutex);
+    return database->impl().choice(uniqueId(), person->uniqueId(), std::string(property));
+}
+
+void CXGroup::setDistributionIdentifier(const std::optional<std::string>& identifier, std::string_view property,
+                                        const CXPersonRef& person) {
+    CXRolvane& database = databaseOfBoth(*this, person);
+    if (isAllGroup()) return;
+    std::lock_guard lock(database.impl().mutex);
+    database.impl().setChoice(uniqueId(), person->uniqueId(), std::string(property), identifier);
+}
+
+std::map<UniqueId, CXDistributionChoices> CXGroup::distributionChoices() const {
+    CXRolvane* database = owner();
+    if (!database || isAllGroup()) return {};
+    std::lock_guard lock(database->impl().mutex);
+    return database->impl().choicesOfGroup(uniqueId());
+}
+
+std::map<UniqueId, CXDistributionChoices> CXGroup::distributionChoicesForPerson(const CXPerson& person) {
+    CXRolvane* database = person.rolvane();
+    if (!database) return {};
+    std::lock_guard lock(database->impl().mutex);
+    return database->impl().choicesOfPerson(person.uniqueId());
+}
+
+CXSubscriptionRef CXGroup::subscription() const {
+    CXRolvane* database = owner();
+    RemoteLocation location = remoteLocation();
+    if (!database || !isSubscribed() || location.empty()) return nullptr;
+    return database->findSubscriptionWithRemoteLocation(location);
+}
+
+UniqueId CXGroupContents::nts_GroupUID() const {
+    bool subscribed = cxTableName(uniqueId()) == kCXSubscribedGroupContentsTable;
+    return cxUIDWithTableName(uniqueId(), subscribed ? kCXSubscribedGroupTable : kCXGroupTable);
+}
+
+} // namespace rolvane

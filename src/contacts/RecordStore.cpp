@@ -1,0 +1,303 @@
+#include "contacts/RecordStore.h"
+
+#include "foundation/Paths.h"
+#include "foundation/PropertyList.h"
+
+#include <chrono>
+#include <thread>
+
+namespace rolvane {
+
+namespace {
+
+constexpr int kFormat = 1;
+constexpr int64_t kApplicationId = 0x52564c43; // "RVLC"
+
+constexpr const char* kTables = R"(
+CREATE TABLE meta(key TEXT PRIMARY KEY, value) WITHOUT ROWID;
+CREATE TABLE records(
+  id INTEGER PRIMARY KEY AUTOINCREMENT,
+  uid TEXT NOT NULL UNIQUE,
+  kind INTEGER NOT NULL,
+  location TEXT NOT NULL,
+  created REAL NOT NULL,
+  modified REAL NOT NULL,
+  display TEXT NOT NULL,
+  sort TEXT NOT NULL,
+  search TEXT NOT NULL,
+  properties BLOB NOT NULL);
+CREATE INDEX records_modified ON records(kind, modified);
+CREATE INDEX records_location ON records(kind, location);
+CREATE TABLE listed(
+  group_id INTEGER NOT NULL REFERENCES records(id) ON DELETE CASCADE,
+  position INTEGER NOT NULL,
+  member_id INTEGER NOT NULL REFERENCES records(id) ON DELETE CASCADE,
+  PRIMARY KEY(group_id, position)) WITHOUT ROWID;
+CREATE UNIQUE INDEX listed_member ON listed(member_id, group_id);
+CREATE TABLE choices(
+  group_id INTEGER NOT NULL REFERENCES records(id) ON DELETE CASCADE,
+  person_id INTEGER NOT NULL REFERENCES records(id) ON DELETE CASCADE,
+  property TEXT NOT NULL,
+  identifier TEXT NOT NULL,
+  PRIMARY KEY(group_id, person_id, property)) WITHOUT ROWID;
+CREATE INDEX choices_person ON choices(person_id);
+CREATE TABLE saves(
+  id INTEGER PRIMARY KEY AUTOINCREMENT,
+  pid INTEGER NOT NULL,
+  program TEXT NOT NULL,
+  date REAL NOT NULL,
+  token TEXT NOT NULL);
+CREATE TABLE journal(
+  seq INTEGER PRIMARY KEY AUTOINCREMENT,
+  save INTEGER NOT NULL,
+  uid TEXT NOT NULL,
+  change INTEGER NOT NULL);
+CREATE TABLE cursors(program TEXT PRIMARY KEY, seq INTEGER NOT NULL) WITHOUT ROWID;
+)";
+
+// Switching a new file to WAL is the one step that does not wait for others by itself.
+void switchToWAL(Sqlite& database) {
+    for (int attempt = 0;; attempt++) {
+        try {
+            database.execute("PRAGMA journal_mode=WAL");
+            return;
+        } catch (const CXException&) {
+            if (attempt == 100) throw;
+            std::this_thread::sleep_for(std::chrono::milliseconds(20));
+        }
+    }
+}
+
+std::vector<std::pair<int64_t, UniqueId>> numbered(Sqlite::Statement& s) {
+    std::vector<std::pair<int64_t, UniqueId>> all;
+    while (s.step()) all.emplace_back(s.integer(0), UniqueId(s.text(1)));
+    return all;
+}
+
+} // namespace
+
+RecordStore::RecordStore(Sqlite& database) : _database(database) {
+    makeOrCheckFormat();
+    _database.execute("PRAGMA synchronous=FULL; PRAGMA foreign_keys=ON; PRAGMA cache_size=-8000;");
+}
+
+void RecordStore::makeOrCheckFormat() {
+    auto isNew = [this] {
+        return _database.integer("PRAGMA user_version") == 0 &&
+               _database.integer("SELECT count(*) FROM sqlite_master") == 0;
+    };
+    if (isNew()) {
+        switchToWAL(_database);
+        _database.execute("PRAGMA synchronous=FULL");
+        SqliteTransaction transaction(_database);
+        if (isNew()) fillNewDatabase(); // nobody else made it meanwhile
+        transaction.commit();
+    }
+    if (_database.integer("PRAGMA application_id") != kApplicationId)
+        throw CXException(kCXDatabaseException, "The file " + _database.path() +
+                                                    " is no contact database. Name another file or move it away.");
+    int64_t format = _database.integer("PRAGMA user_version");
+    if (format > kFormat)
+        throw CXException(kCXDatabaseException, "The contact database " + _database.path() +
+                                                    " was written by a newer version (format " +
+                                                    std::to_string(format) + ", this version knows " +
+                                                    std::to_string(kFormat) + "). Install that version to open it.");
+}
+
+void RecordStore::fillNewDatabase() {
+    _database.execute(kTables);
+    _database.execute("PRAGMA application_id=" + std::to_string(kApplicationId));
+    _database.execute("PRAGMA user_version=" + std::to_string(kFormat));
+    _database.statement("INSERT INTO meta VALUES('identity', ?)").bind(1, makeUUID()).run();
+    // A share count that no other new database is likely to have: a new file is noticed as another one.
+    int64_t count = 0;
+    for (char c : makeUUID().substr(0, 6)) count = count * 37 + c;
+    _database.statement("INSERT INTO meta VALUES('shareCount', ?)").bind(1, count % 1000000000).run();
+    Date now = Clock::system().now();
+    insertRow(UniqueId(kCXAllGroupUID), RecordKind::allGroup,
+              {{kCXGroupNameProperty, defaultGroupName(RecordKind::allGroup)}}, now, now);
+    insertRow(makeUniqueId(kCXSubscriptionTable), RecordKind::subscription,
+              {{kCXRemoteLocationProperty, kCXLocalRemoteLocation}, {kCXSubscriptionIsAllProperty, false}}, now, now);
+}
+
+uint64_t RecordStore::generation() {
+    return (_ownWrites << 32) + static_cast<uint64_t>(_database.integer("PRAGMA data_version"));
+}
+
+std::string RecordStore::identity() {
+    auto s = _database.statement("SELECT value FROM meta WHERE key='identity'");
+    return s.step() ? s.text(0) : "";
+}
+
+int64_t RecordStore::shareCount() {
+    return _database.integer("SELECT value FROM meta WHERE key='shareCount'");
+}
+
+void RecordStore::setShareCount(int64_t count) {
+    _database.statement("INSERT OR REPLACE INTO meta VALUES('shareCount', ?)").bind(1, count).run();
+}
+
+std::optional<StoredRow> RecordStore::row(const UniqueId& uid) {
+    auto s =
+        _database.statement("SELECT id, uid, kind, location, created, modified, properties FROM records WHERE uid=?");
+    if (!s.bind(1, uid.str()).step()) return std::nullopt;
+    StoredRow row;
+    row.id = s.integer(0);
+    row.uid = UniqueId(s.text(1));
+    row.kind = static_cast<RecordKind>(s.integer(2));
+    row.location = s.text(3);
+    row.created = Date(s.real(4));
+    row.modified = Date(s.real(5));
+    row.properties = std::make_shared<const Bytes>(s.bytes(6));
+    return row;
+}
+
+int64_t RecordStore::rowNumber(const UniqueId& uid) {
+    auto s = _database.statement("SELECT id FROM records WHERE uid=?");
+    return s.bind(1, uid.str()).step() ? s.integer(0) : 0;
+}
+
+std::pair<int64_t, RecordKind> RecordStore::numberAndKind(const UniqueId& uid) {
+    auto s = _database.statement("SELECT id, kind FROM records WHERE uid=?");
+    if (!s.bind(1, uid.str()).step()) return {0, RecordKind::none};
+    return {s.integer(0), static_cast<RecordKind>(s.integer(1))};
+}
+
+std::optional<UniqueId> RecordStore::firstOfLocation(RecordKind kind, std::string_view location) {
+    auto s = _database.statement("SELECT uid FROM records WHERE kind=? AND location=? ORDER BY id LIMIT 1");
+    if (!s.bind(1, static_cast<int>(kind)).bind(2, location).step()) return std::nullopt;
+    return UniqueId(s.text(0));
+}
+
+std::vector<std::pair<int64_t, UniqueId>> RecordStore::recordsOf(RecordKind kind,
+                                                                 const std::optional<std::string>& location) {
+    auto s = _database.statement(location ? "SELECT id, uid FROM records WHERE kind=?1 AND location=?2 ORDER BY id"
+                                          : "SELECT id, uid FROM records WHERE kind=?1 ORDER BY id");
+    s.bind(1, static_cast<int>(kind));
+    if (location) s.bind(2, std::string_view(*location));
+    return numbered(s);
+}
+
+std::vector<UniqueId> RecordStore::listed(const UniqueId& group, bool groups) {
+    auto s = _database.statement(
+        groups ? "SELECT r.uid FROM listed l JOIN records r ON r.id=l.member_id "
+                 "WHERE l.group_id=(SELECT id FROM records WHERE uid=?) AND r.kind IN (3,4) ORDER BY l.position"
+               : "SELECT r.uid FROM listed l JOIN records r ON r.id=l.member_id "
+                 "WHERE l.group_id=(SELECT id FROM records WHERE uid=?) AND r.kind IN (1,2) ORDER BY l.position");
+    s.bind(1, group.str());
+    std::vector<UniqueId> all;
+    while (s.step()) all.emplace_back(s.text(0));
+    return all;
+}
+
+bool RecordStore::isListed(const UniqueId& group, const UniqueId& member) {
+    auto s = _database.statement("SELECT 1 FROM listed WHERE member_id=(SELECT id FROM records WHERE uid=?1) "
+                                 "AND group_id=(SELECT id FROM records WHERE uid=?2)");
+    return s.bind(1, member.str()).bind(2, group.str()).step();
+}
+
+int64_t RecordStore::countMembers(const UniqueId& group) {
+    auto s = _database.statement("SELECT count(*) FROM listed l JOIN records r ON r.id=l.member_id "
+                                 "WHERE l.group_id=(SELECT id FROM records WHERE uid=?) AND r.kind IN (1,2)");
+    s.bind(1, group.str()).step();
+    return s.integer(0);
+}
+
+int64_t RecordStore::countOf(RecordKind kind, const std::optional<std::string>& location) {
+    auto s = _database.statement(location ? "SELECT count(*) FROM records WHERE kind=?1 AND location=?2"
+                                          : "SELECT count(*) FROM records WHERE kind=?1");
+    s.bind(1, static_cast<int>(kind));
+    if (location) s.bind(2, std::string_view(*location));
+    s.step();
+    return s.integer(0);
+}
+
+std::vector<std::pair<int64_t, UniqueId>> RecordStore::parents(const UniqueId& member) {
+    auto s = _database.statement("SELECT g.id, g.uid FROM listed l JOIN records g ON g.id=l.group_id "
+                                 "WHERE l.member_id=(SELECT id FROM records WHERE uid=?) ORDER BY g.id");
+    s.bind(1, member.str());
+    return numbered(s);
+}
+
+namespace {
+
+// Is the property among the keys of an encoded dictionary?
+bool usesProperty(const Bytes& encoded, const std::string& property) {
+    return BinaryValue::decode(encoded).dictionary().contains(property);
+}
+
+} // namespace
+
+std::vector<StoredChoice> RecordStore::choicesOfGroup(const UniqueId& group) {
+    auto s = _database.statement(
+        "SELECT p.uid, c.property, c.identifier, p.properties FROM choices c JOIN records p ON p.id=c.person_id "
+        "WHERE c.group_id=(SELECT id FROM records WHERE uid=?1) AND EXISTS "
+        "(SELECT 1 FROM listed l WHERE l.member_id=c.person_id AND l.group_id=c.group_id)");
+    s.bind(1, group.str());
+    std::vector<StoredChoice> all;
+    while (s.step()) {
+        StoredChoice choice{UniqueId(s.text(0)), s.text(1), s.text(2), true};
+        choice.propertyIsUsed = usesProperty(s.bytes(3), choice.property);
+        all.push_back(std::move(choice));
+    }
+    return all;
+}
+
+std::vector<StoredChoice> RecordStore::choicesOfPerson(const UniqueId& person) {
+    auto s = _database.statement("SELECT g.uid, c.property, c.identifier FROM choices c "
+                                 "JOIN records g ON g.id=c.group_id "
+                                 "WHERE c.person_id=(SELECT id FROM records WHERE uid=?)");
+    s.bind(1, person.str());
+    std::vector<StoredChoice> all;
+    while (s.step()) all.push_back({UniqueId(s.text(0)), s.text(1), s.text(2), true});
+    return all;
+}
+
+std::optional<std::string> RecordStore::choice(const UniqueId& group, const UniqueId& person,
+                                               std::string_view property) {
+    auto s = _database.statement("SELECT identifier FROM choices WHERE group_id=(SELECT id FROM records WHERE uid=?1) "
+                                 "AND person_id=(SELECT id FROM records WHERE uid=?2) AND property=?3");
+    if (!s.bind(1, group.str()).bind(2, person.str()).bind(3, property).step()) return std::nullopt;
+    return s.text(0);
+}
+
+std::vector<CXRow> RecordStore::scan(RecordKind kind, ScanPosition& position, int limit, bool withParents) {
+    SqliteSnapshot snapshot(_database);
+    auto s = _database.statement("SELECT id, uid, location, created, modified, properties FROM records "
+                                 "WHERE kind=?1 AND (modified, id) > (?2, ?3) ORDER BY modified, id LIMIT ?4");
+    s.bind(1, static_cast<int>(kind)).bind(2, position.modified).bind(3, position.id).bind(4, limit);
+    std::vector<CXRow> rows;
+    std::vector<int64_t> ids;
+    while (s.step()) {
+        CXRow row;
+        row.uniqueId = UniqueId(s.text(1));
+        row.sharingUniqueId = cxNormalizedUID(row.uniqueId);
+        row.location = RemoteLocation(s.text(2));
+        row.created = Date(s.real(3));
+        row.modified = Date(s.real(4));
+        row.encoded = std::make_shared<const Bytes>(s.bytes(5));
+        position = {s.real(4), s.integer(0)};
+        ids.push_back(position.id);
+        rows.push_back(std::move(row));
+    }
+    if (withParents) addParents(rows, ids);
+    return rows;
+}
+
+void RecordStore::addParents(std::vector<CXRow>& rows, const std::vector<int64_t>& ids) {
+    auto s = _database.statement("SELECT g.uid FROM listed l JOIN records g ON g.id=l.group_id "
+                                 "WHERE l.member_id=? ORDER BY l.group_id");
+    for (size_t i = 0; i < rows.size(); i++) {
+        s.bind(1, ids[i]);
+        while (s.step()) rows[i].parentGroups.emplace_back(s.text(0));
+        s.reset();
+    }
+}
+
+void RecordStore::forEachLine(RecordKind kind, const std::function<void(Line)>& call) {
+    auto s = _database.statement("SELECT uid, location, display, sort, search FROM records WHERE kind=? ORDER BY id");
+    s.bind(1, static_cast<int>(kind));
+    while (s.step()) call({UniqueId(s.text(0)), s.text(1), s.text(2), s.text(3), s.text(4)});
+}
+
+} // namespace rolvane

@@ -1,0 +1,94 @@
+#pragma once
+
+#include "contacts/CXRolvane.h"
+#include "contacts/RecordKind.h"
+#include "contacts/Sqlite.h"
+
+#include <functional>
+
+namespace rolvane {
+
+// One stored row.
+struct StoredRow {
+    int64_t id = 0;
+    UniqueId uid;
+    RecordKind kind = RecordKind::none;
+    std::string location;
+    Date created, modified;
+    std::shared_ptr<const Bytes> properties;
+};
+
+struct StoredChoice {
+    UniqueId record; // the person's, or the group's when asked for a person
+    std::string property, identifier;
+    bool propertyIsUsed = true;
+};
+
+// Where a scan stands: behind the row with this date and number.
+struct ScanPosition {
+    double modified;
+    int64_t id;
+};
+
+// The tables: every SQL text of the framework but those of the journal. Reads what is saved; the writing operations
+// want an open transaction. Not locked. Row numbers grow with age and are never used again.
+class RecordStore {
+public:
+    // Makes the tables in a new file. Refuses files of a newer format and files that are no contact database.
+    explicit RecordStore(Sqlite& database);
+
+    Sqlite& database() { return _database; }
+    // Changes whenever another connection has committed, and by noteOwnWrite.
+    uint64_t generation();
+    void noteOwnWrite() { _ownWrites++; }
+    std::string identity();
+    int64_t shareCount();
+
+    std::optional<StoredRow> row(const UniqueId& uid);
+    int64_t rowNumber(const UniqueId& uid); // 0 when there is none
+    std::pair<int64_t, RecordKind> numberAndKind(const UniqueId& uid);
+    std::optional<UniqueId> firstOfLocation(RecordKind kind, std::string_view location);
+    // With row numbers, by age.
+    std::vector<std::pair<int64_t, UniqueId>> recordsOf(RecordKind kind, const std::optional<std::string>& location);
+    // Members (people) or subgroups in list order.
+    std::vector<UniqueId> listed(const UniqueId& group, bool groups);
+    bool isListed(const UniqueId& group, const UniqueId& member);
+    int64_t countMembers(const UniqueId& group);
+    int64_t countOf(RecordKind kind, const std::optional<std::string>& location);
+    std::vector<std::pair<int64_t, UniqueId>> parents(const UniqueId& member); // groups, by age
+    std::vector<StoredChoice> choicesOfGroup(const UniqueId& group);
+    std::vector<StoredChoice> choicesOfPerson(const UniqueId& person);
+    std::optional<std::string> choice(const UniqueId& group, const UniqueId& person, std::string_view property);
+    // Rows of the kind behind the position, by modification date; moves the position. With the parents, if wanted.
+    std::vector<CXRow> scan(RecordKind kind, ScanPosition& position, int limit, bool withParents);
+    // Calls with uid, location, display, sort and search text of every row of the kind.
+    struct Line {
+        UniqueId uid;
+        std::string location, display, sort, search;
+    };
+    void forEachLine(RecordKind kind, const std::function<void(Line)>& call);
+
+    // Within a transaction ---------------------------------------------------------------------------------------
+    void insertRow(const UniqueId& uid, RecordKind kind, const Dictionary& properties, Date created, Date modified);
+    void updateRow(int64_t id, RecordKind kind, const Dictionary& properties, const Bytes& encoded, Date modified);
+    void removeRow(int64_t id);
+    void setModified(int64_t id, Date modified);
+    void touchParents(int64_t member, Date modified);
+    bool addListed(int64_t group, int64_t member);
+    bool removeListed(int64_t group, int64_t member);
+    bool isReachable(int64_t from, int64_t to); // through lists
+    bool setChoice(int64_t group, int64_t person, const std::string& property, const std::string& identifier);
+    bool removeChoice(int64_t group, int64_t person, const std::string& property);
+    bool removeChoices(int64_t group, int64_t person);
+    void setShareCount(int64_t count);
+
+private:
+    void makeOrCheckFormat();
+    void fillNewDatabase();
+    void addParents(std::vector<CXRow>& rows, const std::vector<int64_t>& ids);
+
+    Sqlite& _database;
+    uint64_t _ownWrites = 0;
+};
+
+} // namespace rolvane

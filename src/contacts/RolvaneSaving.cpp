@@ -1,0 +1,159 @@
+// One save: one transaction, one journal entry a record, one signal.
+
+#include "contacts/RolvaneImpl.h"
+
+#include "foundation/Log.h"
+#include "foundation/PropertyList.h"
+
+#include <unistd.h>
+
+namespace rolvane {
+
+namespace {
+
+// Writes a unit of work into an open transaction.
+class Saver {
+public:
+    Saver(RecordStore& store, Journal& journal, const std::string& identity, const std::string& program, Date date)
+        : _store(store), _journal(journal), _identity(identity), _program(program), _date(date) {}
+
+    void write(const UnitOfWork& work) {
+        auto records = work.inOrder();
+        for (const auto& [uid, record] : records)
+            if (record->deleted || record->purged) removeRecord(uid, *record);
+        for (const auto& [uid, record] : records)
+            if (!record->deleted) writeRecord(uid, *record);
+        for (const auto& [group, changes] : work.memberships()) writeMembership(group, changes);
+        if (work.shareCount()) _store.setShareCount(*work.shareCount());
+        if (_save) _journal.prune();
+    }
+    bool changedRecords() const { return _save != 0; }
+
+private:
+    void note(const UniqueId& uid, CXChangeKind kind) {
+        if (!_save) _save = _journal.beginSave(::getpid(), _program, _date);
+        _journal.note(_save, uid, kind);
+        _noted.insert(uid);
+    }
+
+    void removeRow(const StoredRow& row) {
+        _store.touchParents(row.id, _date);
+        _store.removeRow(row.id);
+    }
+
+    void removeRecord(const UniqueId& uid, const PendingRecord& record) {
+        std::optional<StoredRow> row = _store.row(uid);
+        if (!row) return; // another process was faster
+        removeRow(*row);
+        if (record.purged) return; // a new record of the identifier follows
+        if (!isAllKind(row->kind)) note(uid, CXChangeKind::deleted);
+        if (row->kind == RecordKind::subscription) removeCopies(row->location);
+    }
+
+    // What other processes have added to a location since its removal was asked for.
+    void removeCopies(const std::string& location) {
+        for (RecordKind kind :
+             {RecordKind::subscribedGroup, RecordKind::subscribedPerson, RecordKind::allSubscribedGroup})
+            for (const auto& [number, uid] : _store.recordsOf(kind, location)) {
+                _store.removeRow(number);
+                if (!isAllKind(kind)) note(uid, CXChangeKind::deleted);
+            }
+    }
+
+    void writeRecord(const UniqueId& uid, const PendingRecord& record) {
+        std::optional<StoredRow> row = _store.row(uid);
+        if (!row && record.isInsertion()) {
+            _store.insertRow(uid, record.kind, record.over({}), _date, _date);
+            if (!isAllKind(record.kind)) note(uid, CXChangeKind::inserted);
+            return;
+        }
+        if (!row) {
+            CXLog("%@ was removed by another program; the changes made to it here are dropped.", uid);
+            return;
+        }
+        if (record.changesProperties()) updateRow(uid, record, *row);
+    }
+
+    void updateRow(const UniqueId& uid, const PendingRecord& record, const StoredRow& row) {
+        Dictionary before = record.replaced ? Dictionary() : BinaryValue::decode(*row.properties).dictionary();
+        Dictionary after = record.over(before);
+        Bytes encoded = BinaryValue::encode(after);
+        if (encoded == *row.properties && record.kind == row.kind) return; // nothing has changed after all
+        _store.updateRow(row.id, record.kind, after, encoded, _date);
+        note(record.kind == RecordKind::allGroup ? UniqueId(_identity + ":" + std::string(kCXInfoTable)) : uid,
+             CXChangeKind::updated);
+    }
+
+    void writeMembership(const UniqueId& group, const PendingMembership& changes) {
+        int64_t number = _store.rowNumber(group);
+        if (number == 0) return;
+        bool changed = false;
+        for (const UniqueId& member : changes.removed) changed |= _store.removeListed(number, _store.rowNumber(member));
+        for (const UniqueId& person : changes.choicesDropped)
+            changed |= _store.removeChoices(number, _store.rowNumber(person));
+        for (const UniqueId& member : changes.added) changed |= addMember(group, number, member);
+        for (const auto& [person, chosen] : changes.choices) changed |= writeChoices(number, person, chosen);
+        if (!changed) return;
+        _store.setModified(number, _date);
+        if (!_noted.contains(group))
+            note(cxUIDWithTableName(group,
+                                    cxIsSubscribed(group) ? kCXSubscribedGroupContentsTable : kCXGroupContentsTable),
+                 CXChangeKind::updated);
+    }
+
+    bool addMember(const UniqueId& group, int64_t number, const UniqueId& member) {
+        auto [row, kind] = _store.numberAndKind(member);
+        if (row == 0) return false; // another process has removed it
+        if (isGroup(kind) && _store.isReachable(row, number)) {
+            CXLog("%@ cannot become a subgroup of %@, which another program has put below it; left out.", member,
+                  group);
+            return false;
+        }
+        return _store.addListed(number, row);
+    }
+
+    bool writeChoices(int64_t group, const UniqueId& person,
+                      const std::map<std::string, std::optional<std::string>>& chosen) {
+        int64_t number = _store.rowNumber(person);
+        if (number == 0) return false;
+        bool changed = false;
+        for (const auto& [property, identifier] : chosen)
+            changed |= identifier ? _store.setChoice(group, number, property, *identifier)
+                                  : _store.removeChoice(group, number, property);
+        return changed;
+    }
+
+    RecordStore& _store;
+    Journal& _journal;
+    const std::string& _identity;
+    const std::string& _program;
+    Date _date;
+    int64_t _save = 0;
+    std::set<UniqueId> _noted;
+};
+
+} // namespace
+
+void CXRolvane::Impl::save() {
+    if (work.empty()) return;
+    bool changedRecords;
+    {
+        SqliteTransaction transaction(sqlite);
+        Saver saver(store, journal, identity, options.program, clock.now());
+        saver.write(work);
+        transaction.commit();
+        changedRecords = saver.changedRecords();
+    }
+    work.clear();
+    store.noteOwnWrite();
+    if (!changedRecords) return;
+    ChangeWatcher::touch(options.path);
+    if (options.distributed)
+        options.distributed->post({kCXDatabaseChangedDistributedNotification,
+                                   std::nullopt,
+                                   {{kCXDatabasePathKey, options.path},
+                                    {kCXDatabaseIdentityKey, identity},
+                                    {kCXSenderProcessID, static_cast<int64_t>(::getpid())}}});
+}
+
+} // namespace rolvane

@@ -1,0 +1,220 @@
+#include "contacts/Sqlite.h"
+
+#include <cerrno>
+#include <cstring>
+#include <fcntl.h>
+#include <sqlite3.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+namespace rolvane {
+
+namespace {
+
+bool isNoRoom(int code, int systemError) {
+    if (code == SQLITE_FULL) return true;
+    return code == SQLITE_IOERR && (systemError == ENOSPC || systemError == EDQUOT || systemError == EFBIG);
+}
+
+std::string explanation(int code, int systemError, const std::string& detail) {
+    if (isNoRoom(code, systemError))
+        return "there is no room left on its disk. Nothing stored was lost; free some space and try again.";
+    switch (code) {
+    case SQLITE_BUSY:
+    case SQLITE_LOCKED:
+        return "another program has kept it locked for too long. Nothing was lost; try again in a moment.";
+    case SQLITE_READONLY:
+    case SQLITE_PERM:
+    case SQLITE_AUTH:
+        return "it cannot be written (" + detail + "). Check the permissions of the file and of its directory.";
+    case SQLITE_CANTOPEN:
+        return "it cannot be opened (" + detail + "). Check that its directory exists and the permissions of both.";
+    case SQLITE_CORRUPT:
+    case SQLITE_NOTADB:
+        return "the file is damaged (" + detail +
+               "). It was left as it is; move it away and put a backup in its place.";
+    case SQLITE_IOERR:
+        return std::string("its disk reports an error (") + detail +
+               (systemError ? std::string(", ") + std::strerror(systemError) : std::string()) +
+               "). Check the disk, then try again.";
+    default: return detail + ". This is unexpected; please report it.";
+    }
+}
+
+// The mode holds whatever the umask is; an existing file keeps its own.
+void makePrivateFile(const std::string& path) {
+    int fd = ::open(path.c_str(), O_RDWR | O_CREAT | O_EXCL | O_CLOEXEC, 0600);
+    if (fd < 0) return; // there already, or the opening that follows says why not
+    ::fchmod(fd, 0600);
+    ::close(fd);
+}
+
+} // namespace
+
+void throwSqliteError(sqlite3* handle, int code, const std::string& path, std::string_view doing) {
+    int systemError = handle ? sqlite3_system_errno(handle) : 0;
+    std::string detail = handle ? sqlite3_errmsg(handle) : sqlite3_errstr(code);
+    throw CXException(kCXDatabaseException, "Could not " + std::string(doing) + " the contact database " + path + ": " +
+                                                explanation(code & 0xff, systemError, detail));
+}
+
+struct Sqlite::Prepared {
+    sqlite3_stmt* statement = nullptr;
+    bool onLoan = false;
+    ~Prepared() { sqlite3_finalize(statement); }
+};
+
+Sqlite::Sqlite(const std::string& path, int busyTimeoutMilliseconds) : _path(path) {
+    makePrivateFile(path);
+    int code = sqlite3_open_v2(path.c_str(), &_handle, SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX, nullptr);
+    if (code != SQLITE_OK) {
+        std::unique_ptr<sqlite3, int (*)(sqlite3*)> closing(_handle, sqlite3_close_v2);
+        throwSqliteError(_handle, code, path, "open");
+    }
+    sqlite3_extended_result_codes(_handle, 1);
+    sqlite3_busy_timeout(_handle, busyTimeoutMilliseconds);
+}
+
+Sqlite::~Sqlite() {
+    _prepared.clear();
+    sqlite3_close_v2(_handle);
+}
+
+std::shared_ptr<Sqlite::Prepared> Sqlite::prepare(std::string_view sql) {
+    auto made = std::make_shared<Prepared>();
+    int code = sqlite3_prepare_v3(_handle, sql.data(), static_cast<int>(sql.size()), SQLITE_PREPARE_PERSISTENT,
+                                  &made->statement, nullptr);
+    if (code != SQLITE_OK) throwSqliteError(_handle, code, _path, "read");
+    return made;
+}
+
+Sqlite::Statement Sqlite::statement(std::string_view sql) {
+    auto found = _prepared.find(sql);
+    if (found == _prepared.end()) found = _prepared.emplace(std::string(sql), prepare(sql)).first;
+    if (found->second->onLoan) return Statement(*this, prepare(sql));
+    return Statement(*this, found->second);
+}
+
+void Sqlite::execute(const std::string& sql) {
+    int code = sqlite3_exec(_handle, sql.c_str(), nullptr, nullptr, nullptr);
+    if (code != SQLITE_OK) throwSqliteError(_handle, code, _path, "use");
+}
+
+int64_t Sqlite::integer(std::string_view sql) {
+    Statement s = statement(sql);
+    return s.step() ? s.integer(0) : 0;
+}
+
+int Sqlite::changes() const {
+    return sqlite3_changes(_handle);
+}
+int64_t Sqlite::lastInsertId() const {
+    return sqlite3_last_insert_rowid(_handle);
+}
+
+Sqlite::Statement::Statement(Sqlite& database, std::shared_ptr<Prepared> prepared)
+    : _database(database), _prepared(std::move(prepared)) {
+    _prepared->onLoan = true;
+}
+
+Sqlite::Statement::~Statement() {
+    reset();
+    sqlite3_clear_bindings(_prepared->statement);
+    _prepared->onLoan = false;
+}
+
+void Sqlite::Statement::reset() {
+    sqlite3_reset(_prepared->statement);
+}
+
+void Sqlite::Statement::check(int code) const {
+    if (code == SQLITE_OK) return;
+    bool reading = sqlite3_stmt_readonly(_prepared->statement) != 0;
+    throwSqliteError(_database._handle, code, _database._path, reading ? "read" : "write to");
+}
+
+Sqlite::Statement& Sqlite::Statement::bind(int index, int64_t value) {
+    check(sqlite3_bind_int64(_prepared->statement, index, value));
+    return *this;
+}
+
+Sqlite::Statement& Sqlite::Statement::bind(int index, double value) {
+    check(sqlite3_bind_double(_prepared->statement, index, value));
+    return *this;
+}
+
+Sqlite::Statement& Sqlite::Statement::bind(int index, std::string_view text) {
+    check(sqlite3_bind_text64(_prepared->statement, index, text.data() ? text.data() : "", text.size(),
+                              SQLITE_TRANSIENT, SQLITE_UTF8));
+    return *this;
+}
+
+Sqlite::Statement& Sqlite::Statement::bind(int index, const Bytes& bytes) {
+    if (bytes.empty())
+        check(sqlite3_bind_zeroblob(_prepared->statement, index, 0));
+    else
+        check(sqlite3_bind_blob64(_prepared->statement, index, bytes.data(), bytes.size(), SQLITE_STATIC));
+    return *this;
+}
+
+bool Sqlite::Statement::step() {
+    int code = sqlite3_step(_prepared->statement);
+    if (code == SQLITE_ROW) return true;
+    if (code != SQLITE_DONE) check(code);
+    return false;
+}
+
+int64_t Sqlite::Statement::integer(int column) const {
+    return sqlite3_column_int64(_prepared->statement, column);
+}
+double Sqlite::Statement::real(int column) const {
+    return sqlite3_column_double(_prepared->statement, column);
+}
+
+std::string Sqlite::Statement::text(int column) const {
+    const auto* text = reinterpret_cast<const char*>(sqlite3_column_text(_prepared->statement, column));
+    if (!text) return {};
+    return {text, static_cast<size_t>(sqlite3_column_bytes(_prepared->statement, column))};
+}
+
+Bytes Sqlite::Statement::bytes(int column) const {
+    const auto* data = static_cast<const uint8_t*>(sqlite3_column_blob(_prepared->statement, column));
+    if (!data) return {};
+    return {data, data + sqlite3_column_bytes(_prepared->statement, column)};
+}
+
+bool Sqlite::Statement::isNull(int column) const {
+    return sqlite3_column_type(_prepared->statement, column) == SQLITE_NULL;
+}
+
+SqliteTransaction::SqliteTransaction(Sqlite& database) : _database(database) {
+    _database.statement("BEGIN IMMEDIATE").run();
+}
+
+SqliteTransaction::~SqliteTransaction() {
+    if (!_open) return;
+    try {
+        _database.statement("ROLLBACK").run();
+    } catch (const CXException&) {
+        // SQLite has rolled back by itself: that is what it does after a full disk or a failed read.
+    }
+}
+
+void SqliteTransaction::commit() {
+    _database.statement("COMMIT").run();
+    _open = false;
+}
+
+SqliteSnapshot::SqliteSnapshot(Sqlite& database) : _database(database) {
+    _database.statement("BEGIN").run();
+}
+
+SqliteSnapshot::~SqliteSnapshot() {
+    try {
+        _database.statement("COMMIT").run();
+    } catch (const CXException&) {
+        // A reading transaction has nothing to lose.
+    }
+}
+
+} // namespace rolvane

@@ -1,0 +1,102 @@
+#pragma once
+
+#include "foundation/Value.h"
+
+#include <cstdint>
+#include <map>
+#include <memory>
+#include <string>
+#include <string_view>
+
+struct sqlite3;
+struct sqlite3_stmt;
+
+namespace rolvane {
+
+// Turns a failure of SQLite into a CXException kCXDatabaseException: what could not be done, with which file, why, and
+// what to do. The only place that knows SQLite's error codes.
+[[noreturn]] void throwSqliteError(sqlite3* handle, int code, const std::string& path, std::string_view doing);
+
+// One connection. Not locked: its owner sees to it that one thread at a time uses it. Every failure throws.
+class Sqlite {
+    struct Prepared;
+
+public:
+    // Makes the file (0600) when it is missing; waits so long for other writers before "in use" is an error.
+    Sqlite(const std::string& path, int busyTimeoutMilliseconds);
+    ~Sqlite();
+    Sqlite(const Sqlite&) = delete;
+    Sqlite& operator=(const Sqlite&) = delete;
+
+    // A prepared statement on loan: parameters are numbered from 1, columns from 0. Reset when it goes out of scope.
+    class Statement {
+    public:
+        Statement(Sqlite& database, std::shared_ptr<Prepared> prepared);
+        ~Statement();
+        Statement(const Statement&) = delete;
+        Statement& operator=(const Statement&) = delete;
+
+        Statement& bind(int index, int64_t value);
+        Statement& bind(int index, int value) { return bind(index, static_cast<int64_t>(value)); }
+        Statement& bind(int index, double value);
+        Statement& bind(int index, std::string_view text); // copied
+        Statement& bind(int index, const Bytes& bytes);    // borrowed until the statement ends
+        bool step();                                       // true: a row is there
+        void run() { step(); }
+        void reset(); // for another round with new parameters
+
+        int64_t integer(int column) const;
+        double real(int column) const;
+        std::string text(int column) const;
+        Bytes bytes(int column) const;
+        bool isNull(int column) const;
+
+    private:
+        void check(int code) const;
+        Sqlite& _database;
+        std::shared_ptr<Prepared> _prepared;
+    };
+
+    Statement statement(std::string_view sql); // kept prepared; a second loan of one text prepares another
+    void execute(const std::string& sql);      // any number of statements, no results
+    int64_t integer(std::string_view sql);     // first column of the first row, 0 when there is none
+    int changes() const;                       // rows changed by the last statement
+    int64_t lastInsertId() const;
+    const std::string& path() const { return _path; }
+
+private:
+    friend class Statement;
+    std::shared_ptr<Prepared> prepare(std::string_view sql);
+
+    std::string _path;
+    sqlite3* _handle = nullptr;
+    std::map<std::string, std::shared_ptr<Prepared>, std::less<>> _prepared;
+};
+
+// A write transaction (BEGIN IMMEDIATE): rolled back unless committed.
+class SqliteTransaction {
+public:
+    explicit SqliteTransaction(Sqlite& database);
+    ~SqliteTransaction();
+    SqliteTransaction(const SqliteTransaction&) = delete;
+    SqliteTransaction& operator=(const SqliteTransaction&) = delete;
+    void commit();
+
+private:
+    Sqlite& _database;
+    bool _open = true;
+};
+
+// One unchanging view for several reads.
+class SqliteSnapshot {
+public:
+    explicit SqliteSnapshot(Sqlite& database);
+    ~SqliteSnapshot();
+    SqliteSnapshot(const SqliteSnapshot&) = delete;
+    SqliteSnapshot& operator=(const SqliteSnapshot&) = delete;
+
+private:
+    Sqlite& _database;
+};
+
+} // namespace rolvane

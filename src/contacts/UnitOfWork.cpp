@@ -1,0 +1,118 @@
+#include "contacts/UnitOfWork.h"
+
+#include <algorithm>
+
+namespace rolvane {
+
+Dictionary PendingRecord::over(const Dictionary& stored) const {
+    Dictionary result = replaced ? Dictionary() : stored;
+    for (const auto& [property, value] : changes) {
+        if (value.isAbsent())
+            result.remove(property);
+        else
+            result.set(property, value);
+    }
+    return result;
+}
+
+void PendingMembership::add(const UniqueId& member) {
+    if (removed.erase(member)) return; // keeps its place
+    if (addedSet.insert(member).second) added.push_back(member);
+}
+
+void PendingMembership::remove(const UniqueId& member) {
+    choices.erase(member);
+    choicesDropped.insert(member);
+    if (addedSet.erase(member))
+        std::erase(added, member);
+    else
+        removed.insert(member);
+}
+
+void PendingMembership::forget(const UniqueId& member) {
+    if (addedSet.erase(member)) std::erase(added, member);
+    removed.erase(member);
+    choices.erase(member);
+    choicesDropped.erase(member);
+}
+
+void UnitOfWork::clear() {
+    _records.clear();
+    _memberships.clear();
+    _shareCount.reset();
+}
+
+const PendingRecord* UnitOfWork::find(const UniqueId& uid) const {
+    auto found = _records.find(uid);
+    return found == _records.end() ? nullptr : &found->second;
+}
+
+PendingRecord& UnitOfWork::touch(const UniqueId& uid, RecordKind kind, bool inStore, Date now) {
+    auto [at, made] = _records.try_emplace(uid);
+    if (made) {
+        at->second.order = _nextOrder++;
+        at->second.kind = kind;
+        at->second.inStore = inStore;
+    }
+    at->second.touched = now;
+    return at->second;
+}
+
+PendingRecord& UnitOfWork::insert(const UniqueId& uid, RecordKind kind, bool inStore, Date now) {
+    PendingRecord& record = touch(uid, kind, inStore, now);
+    bool wasDeleted = record.deleted;
+    if (wasDeleted && record.inStore) record.purged = true;
+    if (wasDeleted) record.order = _nextOrder++;
+    record.kind = kind;
+    record.deleted = false;
+    record.replaced = true;
+    record.changes.clear();
+    return record;
+}
+
+void UnitOfWork::remove(const UniqueId& uid, RecordKind kind, bool inStore, Date now) {
+    for (auto at = _memberships.begin(); at != _memberships.end();) {
+        at->second.forget(uid);
+        bool drop = at->first == uid || at->second.empty();
+        at = drop ? _memberships.erase(at) : std::next(at);
+    }
+    PendingRecord& record = touch(uid, kind, inStore, now);
+    if (!record.inStore) {
+        _records.erase(uid);
+        return;
+    }
+    record.deleted = true;
+    record.purged = false;
+    record.replaced = false;
+    record.changes.clear();
+}
+
+bool UnitOfWork::isGone(const UniqueId& uid) const {
+    const PendingRecord* record = find(uid);
+    return record && record->deleted;
+}
+
+bool UnitOfWork::hidesStoredLinks(const UniqueId& uid) const {
+    const PendingRecord* record = find(uid);
+    return record && (record->deleted || record->purged);
+}
+
+const PendingMembership* UnitOfWork::membershipIf(const UniqueId& group) const {
+    auto found = _memberships.find(group);
+    return found == _memberships.end() ? nullptr : &found->second;
+}
+
+void UnitOfWork::dropEmptyMembership(const UniqueId& group) {
+    auto found = _memberships.find(group);
+    if (found != _memberships.end() && found->second.empty()) _memberships.erase(found);
+}
+
+std::vector<std::pair<UniqueId, const PendingRecord*>> UnitOfWork::inOrder() const {
+    std::vector<std::pair<UniqueId, const PendingRecord*>> all;
+    all.reserve(_records.size());
+    for (const auto& [uid, record] : _records) all.emplace_back(uid, &record);
+    std::sort(all.begin(), all.end(), [](const auto& a, const auto& b) { return a.second->order < b.second->order; });
+    return all;
+}
+
+} // namespace rolvane

@@ -1,0 +1,83 @@
+#pragma once
+
+#include "contacts/RecordKind.h"
+#include "foundation/StrongString.h"
+
+#include <map>
+#include <optional>
+#include <set>
+#include <string>
+#include <unordered_map>
+#include <vector>
+
+namespace rolvane {
+
+// What this process has changed in one record and not saved yet.
+struct PendingRecord {
+    uint64_t order = 0; // of the first change, or of the addition; inserted rows are written in this order
+    RecordKind kind = RecordKind::none;
+    bool inStore = false; // there was a row when the record was first touched
+    bool deleted = false;
+    bool purged = false;   // the row was removed before a new record of the identifier was added
+    bool replaced = false; // `changes` are all properties there are
+    std::map<std::string, Value, std::less<>> changes; // an absent value: the property is removed
+    std::string location;                              // as it is with the changes
+    Date touched;
+
+    bool isInsertion() const { return !deleted && (!inStore || purged); }
+    bool changesProperties() const { return replaced || !changes.empty(); }
+    // The stored row (or nothing) with the changes laid over it.
+    Dictionary over(const Dictionary& stored) const;
+};
+
+// What has changed in the lists of one group. Names members and subgroups alike.
+struct PendingMembership {
+    std::vector<UniqueId> added; // in order
+    std::set<UniqueId> addedSet;
+    std::set<UniqueId> removed;
+    std::set<UniqueId> choicesDropped; // people whose stored choices are void
+    std::map<UniqueId, std::map<std::string, std::optional<std::string>>> choices;
+
+    void add(const UniqueId& member);
+    void remove(const UniqueId& member); // with the choices
+    void forget(const UniqueId& member); // the record is gone: nothing of it is left to write
+    bool empty() const { return added.empty() && removed.empty() && choicesDropped.empty() && choices.empty(); }
+};
+
+// The unsaved changes of a database object. Pure bookkeeping: knows no file and no lock.
+class UnitOfWork {
+public:
+    bool empty() const { return _records.empty() && _memberships.empty() && !_shareCount; }
+    void clear();
+
+    const PendingRecord* find(const UniqueId& uid) const;
+    // The entry of a record, made when there is none.
+    PendingRecord& touch(const UniqueId& uid, RecordKind kind, bool inStore, Date now);
+    // A record of the identifier is added: whatever the row was, it is this now, last in order.
+    PendingRecord& insert(const UniqueId& uid, RecordKind kind, bool inStore, Date now);
+    // A record is removed. One that was only added here leaves no trace.
+    void remove(const UniqueId& uid, RecordKind kind, bool inStore, Date now);
+
+    bool isGone(const UniqueId& uid) const;           // removed, whatever comes after
+    bool hidesStoredLinks(const UniqueId& uid) const; // stored memberships of it count no more
+    bool isRecordWithChanges(const UniqueId& uid) const { return _records.contains(uid); }
+
+    PendingMembership& membership(const UniqueId& group) { return _memberships[group]; }
+    const PendingMembership* membershipIf(const UniqueId& group) const;
+    const std::map<UniqueId, PendingMembership>& memberships() const { return _memberships; }
+    void dropEmptyMembership(const UniqueId& group);
+
+    std::vector<std::pair<UniqueId, const PendingRecord*>> inOrder() const;
+    const std::unordered_map<UniqueId, PendingRecord>& records() const { return _records; }
+
+    const std::optional<int64_t>& shareCount() const { return _shareCount; }
+    void setShareCount(int64_t count) { _shareCount = count; }
+
+private:
+    std::unordered_map<UniqueId, PendingRecord> _records;
+    std::map<UniqueId, PendingMembership> _memberships;
+    std::optional<int64_t> _shareCount;
+    uint64_t _nextOrder = 1;
+};
+
+} // namespace rolvane
