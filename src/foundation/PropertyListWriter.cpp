@@ -30,6 +30,12 @@ constexpr std::string_view replacement(char c) {
     }
 }
 
+constexpr std::array<bool, 256> kIsReplaced = [] {
+    std::array<bool, 256> replaced{};
+    for (size_t i = 0; i < replaced.size(); ++i) replaced[i] = !replacement(static_cast<char>(i)).empty();
+    return replaced;
+}();
+
 class Writer {
 public:
     std::string document(const Value& v) {
@@ -121,14 +127,14 @@ private:
     }
 
     void escaped(std::string_view s) {
-        while (!s.empty()) {
-            const size_t plain = std::min(s.find_first_of("&<>\r"), s.size());
-            _out += s.substr(0, plain);
-            s.remove_prefix(plain);
-            if (s.empty()) return;
-            _out += replacement(s[0]);
-            s.remove_prefix(1);
+        size_t done = 0;
+        for (size_t i = 0; i < s.size(); ++i) {
+            if (!kIsReplaced[static_cast<unsigned char>(s[i])]) continue;
+            _out.append(s, done, i - done);
+            _out += replacement(s[i]);
+            done = i + 1;
         }
+        _out.append(s, done);
     }
 
     void element(std::string_view tag, std::string_view content) {
