@@ -6,6 +6,7 @@
 
 #include <optional>
 #include <string>
+#include <vector>
 
 namespace rolvane {
 
@@ -34,8 +35,7 @@ enum class Authentication { automatic, basic, digest };
 class CXDAVAccount {
 public:
     UserName user;
-    std::string endpoint; // template, see above; https, or http when plainLoopback
-    std::string nameHost; // "host[:port]"; empty: the endpoint's host, with its port when it has one
+@@    std::string nameHost; // "host[:port]"; empty: the endpoint's host, with its port when it has one
     PasswordSource passwordSource;
     Authentication authentication = Authentication::automatic;
     std::string caFile;         // PEM file of a private authority; empty: the system's authorities
@@ -59,15 +59,15 @@ public:
     // "http://<nameHost>/<user>/Contacts": the location's name, whoever the user is.
     Url baseLocationFor(const UserName& who) const;
     std::string effectiveNameHost() const;
-    // The endpoint's origin (see Url::origin): the only place that ever gets the password.
-    std::string endpointOrigin() const;
+    // The endpoints' origins (see Url::origin): the only places that ever get the password.
+    std::vector<std::string> origins() const;
 
-    // Name -> where its bytes are. Nothing when the URL is not below a remote location of this account's name host, or
+    // Name -> where its bytes are, https when `securely`. Nothing when the URL is not below a remote location of this account's name host, or
     // when a segment of it is "." or ".." or holds a control character. The scheme of the name (http or https) is not
     // looked at.
-    std::optional<Url> endpointFor(const Url& name) const;
-    // An href of an answer (absolute URL or absolute path) -> the name. Nothing when it leaves the endpoint's origin or
-    // tree, or is hostile as above. A trailing slash is dropped.
+    std::optional<Url> endpointFor(const Url& name, bool securely) const;
+    // An href of an answer (absolute URL or absolute path) -> the name. Nothing when it leaves the endpoints' origins or
+    // trees, or is hostile as above. A trailing slash is dropped.
     std::optional<Url> nameFor(std::string_view href) const;
 
     friend bool operator==(const CXDAVAccount&, const CXDAVAccount&) = default;

@@ -24,6 +24,7 @@ struct CXDAVError {
 inline constexpr int kCXDAVErrorTimedOut = -1001;
 inline constexpr int kCXDAVErrorCannotConnect = -1004;
 inline constexpr int kCXDAVErrorBadServerResponse = -1011; // whoever answered is not a WebDAV server
+inline constexpr int kCXDAVErrorNoPassword = -1013;        // the password cannot be had from its source
 inline constexpr int kCXDAVErrorAuthentication = -1012;    // the account's user name or password was refused
 inline constexpr int kCXDAVErrorSecureConnection = -1200;
 inline constexpr int kCXDAVErrorNoAccount = -1100; // no account, or one that cannot be used
@@ -37,7 +38,8 @@ inline constexpr int kCXDAVErrorNoAccount = -1100; // no account, or one that ca
 //
 // Conditional writes: when a thread reads the dictionary at a URL and its next operation on a dictionary is a write to
 // the same URL, the write goes through only if the file is still the one that was read (or still absent); otherwise
-// it fails with 412.
+// it fails with 412. When that read
+// failed for another reason than absence, the write is not sent and fails with code 0: what is there is not known.
 //
 // A URL may be a group's state file and its directory at once: the dictionary of a collection lies inside it under
 // kStateName, and a file in the way of a collection is moved there when the collection is made. Listings show one
@@ -46,8 +48,14 @@ class CXDAVManager : public CXFileManager {
 public:
     static constexpr const char* kStateName = ".state"; // never a group's, person's or structure file's name
 
+    // Where the versions of files are remembered from run to run; empty: in memory only.
+    struct VersionsFile {
+        std::string path;
+    };
+
     // Credentials are fetched from the account's password source on first need.
-    explicit CXDAVManager(CXDAVAccount account);                        // over a CurlTransport of its own
+    explicit CXDAVManager(CXDAVAccount account); // over a CurlTransport of its own
+    CXDAVManager(CXDAVAccount account, VersionsFile versions);
     CXDAVManager(CXDAVAccount account, std::shared_ptr<HttpTransport>); // over the given transport, which signs in
     ~CXDAVManager() override;
 
@@ -62,7 +70,8 @@ public:
     static bool canReachOstrelError(CXDAVError& error);
     static Url ostrelBaseLocationForOstrelUser(const UserName& user);
     static void updateConfigDataIfNeeded(); // reads the configuration anew when its file changed
-    // An entry of the application's preferences domain, else of configDirectory()/config.plist, else the default.
+    // The entry of the daemon's preferences domain, else of the application's, else of configDirectory()/config.plist,
+    // else the default.
     static Value configValueForKey(const std::string& key, Value defaultValue);
 
     // -- the same for one client
@@ -91,6 +100,10 @@ public:
     virtual bool ACLsAtURL(const Url& url, std::vector<std::string>& readers, std::vector<std::string>& writers);
     virtual bool setACLsWithReadPrincipals(const std::vector<std::string>& readers,
                                            const std::vector<std::string>& writers, const Url& url);
+
+    // Writes down which versions of files are known, so that the next run need not read them again. Losing it costs
+    // reads only. Also done when the client ends.
+    void saveVersionMemory();
 
     // -- ending: every request under way and every later one fails at once. From any thread or a signal handler.
     void abortAll();

@@ -83,7 +83,7 @@ public:
 // What a CurlTransport signs in with, and where.
 struct TransportCredentials {
     std::string user, password;
-    std::string origin; // Url::origin of the only place that gets them
+    std::vector<std::string> origins; // Url::origin of the only places that get them
     enum class Scheme { automatic, basic, digest } scheme = Scheme::automatic;
 };
 
@@ -98,7 +98,7 @@ struct CurlTransportOptions {
 
 // The transport over libcurl: one thread owns a multi handle and every connection; other threads hand requests over.
 // HTTP/2 where the server offers it over TLS (one connection carries up to 100 requests at a time), else HTTP/1.1 with
-// at most `maxConnections` kept-alive connections. Credentials go out unasked, to their origin only, over TLS or to a
+// at most `maxConnections` kept-alive connections. Credentials go out unasked, to their origins only, over TLS or to a
 // peer that is the loopback interface (the address of the connection is checked, not the name). Digest costs one
 // challenge a connection handle, then goes unasked too. A 503 or 429 with Retry-After holds back all requests to all
 // places until then, and the refused request is sent once more if its deadline allows.

@@ -1,0 +1,163 @@
+#include "store/CXDAVManager.h"
+
+#include "foundation/CXException.h"
+#include "foundation/Log.h"
+#include "foundation/Paths.h"
+#include "store/CXDAVManagerImpl.h"
+#include "store/StoreConfiguration.h"
+
+namespace rolvane {
+
+namespace {
+
+std::mutex sharedMutex;
+std::shared_ptr<CXDAVManager> sharedManager;
+
+// The saved account, or an empty one, with which every operation fails.
+CXDAVAccount savedAccount() {
+    try {
+        if (auto account = CXDAVAccount::load()) return *account;
+    } catch (const CXException& e) {
+        CXLog("%@", e.reason());
+    }
+    return {};
+}
+
+std::string versionMemoryPath() {
+    try {
+        return cacheDirectory() + "/versions";
+    } catch (const CXException& e) {
+        CXLog("Versions are remembered in memory only: %@", e.reason());
+        return {};
+    }
+}
+
+void setCode(int* code, int value) {
+    if (code) *code = value;
+}
+
+} // namespace
+
+CXDAVManager::Impl::Impl(CXDAVAccount account, std::shared_ptr<HttpTransport> transport, CurlTransport* signsIn,
+                         std::string versionsPath)
+    : versions(std::move(versionsPath)), session(std::move(account), std::move(transport), signsIn),
+      files(session, tokens, versions), structure(session, files) {}
+
+CXDAVManager::CXDAVManager(CXDAVAccount account) : CXDAVManager(std::move(account), VersionsFile()) {}
+
+CXDAVManager::CXDAVManager(CXDAVAccount account, VersionsFile versions) {
+    std::shared_ptr<CurlTransport> transport = makeAccountTransport(account);
+    CurlTransport* signsIn = transport.get();
+    _impl = std::make_shared<Impl>(std::move(account), std::move(transport), signsIn, std::move(versions.path));
+}
+
+CXDAVManager::CXDAVManager(CXDAVAccount account, std::shared_ptr<HttpTransport> transport)
+    : _impl(std::make_shared<Impl>(std::move(account), std::move(transport), nullptr, std::string())) {}
+
+CXDAVManager::~CXDAVManager() { _impl->versions.save(); }
+
+const CXDAVAccount& CXDAVManager::account() const { return _impl->session.account(); }
+HttpTransport& CXDAVManager::transport() { return _impl->session.transport(); }
+
+// ---- the process's own
+
+static std::shared_ptr<CXDAVManager> shared() {
+    std::lock_guard guard(sharedMutex);
+    if (!sharedManager)
+        sharedManager = std::make_shared<CXDAVManager>(savedAccount(), CXDAVManager::VersionsFile{versionMemoryPath()});
+    return sharedManager;
+}
+
+CXDAVManager& CXDAVManager::defaultManager() { return *shared(); }
+
+void CXDAVManager::setDefaultManager(std::shared_ptr<CXDAVManager> manager) {
+    std::lock_guard guard(sharedMutex);
+    std::swap(sharedManager, manager);
+}
+
+std::string CXDAVManager::vaultraUser() { return shared()->account().user.str(); }
+std::string CXDAVManager::password() { return shared()->_impl->session.password().value_or(""); }
+std::string CXDAVManager::ostrelUserAgent() { return "Rolvane/" ROLVANE_VERSION; }
+
+std::string CXDAVManager::vaultraAddress() {
+    const auto origins = shared()->account().origins();
+    return origins.empty() ? "" : Url(origins.front() + "/").host();
+}
+
+bool CXDAVManager::canReachOstrelError(CXDAVError& error) { return shared()->canReach(error); }
+
+Url CXDAVManager::ostrelBaseLocationForOstrelUser(const UserName& user) {
+    const auto manager = shared();
+    if (manager->account().user.empty()) return {};
+    return manager->account().baseLocationFor(user);
+}
+
+void CXDAVManager::updateConfigDataIfNeeded() { StoreConfiguration::shared().updateIfNeeded(); }
+
+Value CXDAVManager::configValueForKey(const std::string& key, Value defaultValue) {
+    return StoreConfiguration::shared().valueForKey(key, std::move(defaultValue));
+}
+
+// ---- one client
+
+bool CXDAVManager::canReach(CXDAVError& error) {
+    if (account().user.empty()) {
+        error = {kCXDAVErrorNoAccount, "There is no account. Set one with: rolvane account set"};
+        return false;
+    }
+    return _impl->session.canReach(error);
+}
+
+bool CXDAVManager::write(const std::string& text, const Url& url, bool securely) {
+    return write(text, url, securely, nullptr);
+}
+
+bool CXDAVManager::write(const std::string& text, const Url& url, bool securely, int* code) {
+    const Url own = account().baseLocationFor(account().user);
+    const bool isOwn = url.absoluteString().starts_with(own.absoluteString() + "/");
+    const int status = _impl->files.write(
+        url, text, securely, isOwn ? std::function<bool()>([this] { return _impl->structure.repair(); }) : nullptr);
+    setCode(code, status);
+    return StoreFiles::succeeded(status);
+}
+
+std::optional<Date> CXDAVManager::modDateForURL(const Url& url) { return _impl->files.modificationDate(url); }
+
+std::optional<Dictionary> CXDAVManager::dictionaryAtURL(const Url& url, bool securely, int* code) {
+    auto reading = _impl->files.read(url, securely);
+    setCode(code, reading.code);
+    return std::move(reading.dictionary);
+}
+
+std::optional<Dictionary> CXDAVManager::dictionaryAtURL(const Url& url, int* errorCode, bool securely) {
+    return dictionaryAtURL(url, securely, errorCode);
+}
+
+bool CXDAVManager::removeFileAtURL(const Url& url, int* code) {
+    const int status = _impl->files.remove(url);
+    setCode(code, status);
+    return StoreFiles::succeeded(status) || status == 404;
+}
+
+bool CXDAVManager::removeDirectoryAndContentsAtURL(const Url& url) { return removeFileAtURL(url, nullptr); }
+bool CXDAVManager::createDirectoryAtAURL(const Url& url) { return _impl->files.makeCollection(url); }
+
+std::optional<FileListing> CXDAVManager::infoForFilesInContainer(const Url& url) {
+    return StoreListing(_impl->session, _impl->versions).list(url);
+}
+
+bool CXDAVManager::sanityCheckPublishStructureCreate(bool create) {
+    return !account().user.empty() && _impl->structure.check(create);
+}
+
+bool CXDAVManager::ACLsAtURL(const Url&, std::vector<std::string>&, std::vector<std::string>&) { return false; }
+
+bool CXDAVManager::setACLsWithReadPrincipals(const std::vector<std::string>&, const std::vector<std::string>&,
+                                             const Url&) {
+    return false;
+}
+
+void CXDAVManager::saveVersionMemory() { _impl->versions.save(); }
+void CXDAVManager::abortAll() { _impl->session.transport().abortAll(); }
+
+} // namespace rolvane

@@ -1,0 +1,24 @@
+#pragma once
+
+#include "store/CXDAVManager.h"
+#include "store/LockTokens.h"
+#include "store/PublishStructure.h"
+#include "store/StoreFiles.h"
+#include "store/StoreListing.h"
+#include "store/StoreSession.h"
+#include "store/VersionMemory.h"
+
+namespace rolvane {
+
+// What a client is made of, in the order in which its parts need one another.
+struct CXDAVManager::Impl {
+    Impl(CXDAVAccount account, std::shared_ptr<HttpTransport> transport, CurlTransport* signsIn, std::string versionsPath);
+
+    LockTokens tokens;
+    VersionMemory versions;
+    StoreSession session;
+    StoreFiles files;
+    PublishStructure structure;
+};
+
+} // namespace rolvane

@@ -1,0 +1,74 @@
+#pragma once
+
+#include "store/HttpTransport.h"
+
+#include <chrono>
+#include <curl/curl.h>
+#include <memory>
+#include <optional>
+#include <string>
+
+namespace rolvane {
+
+using SteadyTime = std::chrono::steady_clock::time_point;
+
+// A request on its way, with what is known of its answer so far.
+struct HttpJob {
+    HttpRequest request;
+    HttpTransport::Completion done;
+    std::shared_ptr<const TransportCredentials> credentials;
+    std::string origin;
+    SteadyTime deadline;
+    uint64_t epoch = 0; // of abortAll at the hand-over
+    int repetitions = 0;
+
+    HttpResponse response;
+    size_t headerBytes = 0, bodyBytes = 0;
+    TransportError verdict = TransportError::none; // why the transfer was ended from our side
+    std::string verdictDetail;
+
+    void forgetAnswer();
+    bool mayCarryCredentials() const; // only the credentials' own origins get them
+};
+
+// One reusable libcurl easy handle with its callbacks. Lives on the transport's thread.
+class CurlSlot {
+public:
+    explicit CurlSlot(const CurlTransportOptions& options);
+    ~CurlSlot();
+    CurlSlot(const CurlSlot&) = delete;
+    CurlSlot& operator=(const CurlSlot&) = delete;
+
+    CURL* easy() const { return _easy; }
+    HttpJob* job() const { return _job.get(); }
+
+    // Sets the handle up for the job. `digest`: the origin wants Digest.
+    void prepare(std::unique_ptr<HttpJob> job, bool digest);
+    std::unique_ptr<HttpJob> release() { return std::move(_job); }
+
+    // True when not a byte has moved for the job's idle limit.
+    bool isIdle(SteadyTime now);
+
+private:
+    static size_t onHeader(char* data, size_t size, size_t count, void* self);
+    static size_t onBody(char* data, size_t size, size_t count, void* self);
+    static int onConnected(void* self, char* peerAddress, char* localAddress, int peerPort, int localPort);
+
+    bool takeHeaderLine(std::string_view line);
+    bool takeBody(std::string_view bytes);
+    void setMethod();
+    void setHeaders();
+    void setCredentials(bool digest);
+    void setProxy();
+
+    CURL* _easy;
+    curl_slist* _headers = nullptr;
+    std::vector<std::pair<std::string, std::string>> _headersShown; // what `_headers` was built from
+    std::shared_ptr<const TransportCredentials> _signedInAs;
+    bool _digest = false, _plain = false, _proxyOff = false;
+    std::unique_ptr<HttpJob> _job;
+    uint64_t _bytesMoved = 0;
+    SteadyTime _lastMove;
+};
+
+} // namespace rolvane

@@ -1,0 +1,475 @@
+#include "foundation/Date.h"
+#include "store/Account.h"
+#include "store/CurlSlot.h"
+#include "store/HttpTransport.h"
+
+#include <condition_variable>
+#include <deque>
+#include <mutex>
+#include <set>
+#include <signal.h>
+#include <sys/epoll.h>
+#include <sys/eventfd.h>
+#include <thread>
+#include <unistd.h>
+#include <unordered_set>
+
+namespace rolvane {
+
+namespace {
+
+using namespace std::chrono;
+using Steady = steady_clock;
+
+steady_clock::duration inSeconds(double s) { return duration_cast<steady_clock::duration>(duration<double>(s)); }
+
+// The one place where libcurl's codes become ours.
+TransportError translated(CURLcode code) {
+    switch (code) {
+    case CURLE_OK: return TransportError::none;
+    case CURLE_OPERATION_TIMEDOUT: return TransportError::timedOut;
+    case CURLE_SSL_CONNECT_ERROR:
+    case CURLE_PEER_FAILED_VERIFICATION:
+    case CURLE_SSL_CERTPROBLEM:
+    case CURLE_SSL_CIPHER:
+    case CURLE_SSL_CACERT_BADFILE:
+    case CURLE_SSL_ISSUER_ERROR:
+    case CURLE_USE_SSL_FAILED: return TransportError::tls;
+    case CURLE_FILESIZE_EXCEEDED: return TransportError::tooLarge;
+    case CURLE_PARTIAL_FILE:
+    case CURLE_WEIRD_SERVER_REPLY:
+    case CURLE_BAD_CONTENT_ENCODING:
+    case CURLE_UNSUPPORTED_PROTOCOL: return TransportError::truncated;
+    case CURLE_URL_MALFORMAT: return TransportError::refused;
+    default: return TransportError::unreachable;
+    }
+}
+
+// Retry-After (RFC 9110 section 10.2.3) in seconds from now; nothing when there is none or it makes no sense.
+std::optional<double> retryAfterSeconds(const HttpResponse& answer) {
+    const std::string* text = answer.header("retry-after");
+    if (!text || text->empty()) return std::nullopt;
+    if (text->find_first_not_of("0123456789") == std::string::npos) return std::min(1e6, atof(text->c_str()));
+    if (auto date = Date::fromHTTP(*text)) return std::max(0.0, date->secondsSince(Clock::system().now()));
+    return std::nullopt;
+}
+
+// True when the answer asks for Digest and does not take Basic.
+bool wantsDigest(const HttpResponse& answer) {
+    bool digest = false;
+    for (const auto& [name, value] : answer.headers) {
+        if (name != "www-authenticate") continue;
+        if (strncasecmp(value.c_str(), "basic", 5) == 0) return false;
+        digest = digest || strncasecmp(value.c_str(), "digest", 6) == 0;
+    }
+    return digest;
+}
+
+// Why a request cannot be sent as it stands, or "".
+std::string objection(const HttpJob& job) {
+    if (job.origin.starts_with("http:")) {
+        if (!isLoopbackHost(job.request.url.host()))
+            return "Plain http is used on this machine only; " + job.origin + " needs https.";
+    } else if (!job.origin.starts_with("https:")) {
+        return "Only http and https can be sent.";
+    }
+    for (const auto& [name, value] : job.request.headers)
+        if ((name + value).find_first_of(std::string_view("\r\n\0", 3)) != std::string::npos)
+            return "A header of the request holds a line break.";
+    return {};
+}
+
+} // namespace
+
+struct CurlTransport::Impl {
+    explicit Impl(CurlTransportOptions o);
+    ~Impl();
+
+    // Any thread
+    void enqueue(HttpRequest request, Completion done);
+    void wake();
+
+    // The transport's thread
+    void run();
+    void wait();
+    void takeInbox();
+    void dropAborted();
+    void admit();
+    bool heldBack(SteadyTime now);
+    void launch(std::unique_ptr<HttpJob> job);
+    void reap();
+    void finished(CurlSlot& slot, CURLcode code);
+    bool sendAgain(std::unique_ptr<HttpJob>& job);
+    void checkDeadlines();
+    void end(CurlSlot& slot, TransportError error, std::string detail);
+    static void fail(std::unique_ptr<HttpJob> job, TransportError error, std::string detail);
+    void detach(CurlSlot& slot);
+    size_t admissionLimit() const;
+
+    static int onSocket(CURL*, curl_socket_t s, int what, void* self, void* known);
+    static int onTimer(CURLM*, long milliseconds, void* self);
+
+    const CurlTransportOptions options;
+    CURLM* multi = nullptr;
+    int epoll = -1, event = -1;
+
+    std::mutex inboxMutex; // guards inbox and credentials
+    std::vector<std::unique_ptr<HttpJob>> inbox;
+    std::shared_ptr<const TransportCredentials> credentials;
+    std::atomic<bool> sleeping{false}, stopping{false}, aborted{false};
+    std::atomic<uint64_t> abortEpoch{0};
+    std::atomic<uint64_t> requests{0}, connections{0}, challenged{0}, heldBackCount{0};
+
+    // The transport's thread only
+    std::deque<std::unique_ptr<HttpJob>> pending;
+    std::vector<std::unique_ptr<CurlSlot>> slots;
+    std::vector<CurlSlot*> idle;
+    std::unordered_set<CurlSlot*> active;
+    std::set<std::string> digestOrigins;
+    std::set<std::string> http2Origins;
+    SteadyTime notBefore{};                 // Retry-After
+    std::optional<SteadyTime> curlTimer;
+    SteadyTime nextCheck{};
+    uint64_t seenEpoch = 0;
+    std::thread thread;
+};
+
+CurlTransport::Impl::Impl(CurlTransportOptions o) : options(std::move(o)) {
+    static const CURLcode global = curl_global_init(CURL_GLOBAL_ALL);
+    (void)global;
+    multi = curl_multi_init();
+    epoll = epoll_create1(EPOLL_CLOEXEC);
+    event = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
+    if (!multi || epoll < 0 || event < 0) throw std::bad_alloc();
+    epoll_event wanted{};
+    wanted.events = EPOLLIN;
+    wanted.data.fd = event;
+    epoll_ctl(epoll, EPOLL_CTL_ADD, event, &wanted);
+    curl_multi_setopt(multi, CURLMOPT_SOCKETFUNCTION, &Impl::onSocket);
+    curl_multi_setopt(multi, CURLMOPT_SOCKETDATA, this);
+    curl_multi_setopt(multi, CURLMOPT_TIMERFUNCTION, &Impl::onTimer);
+    curl_multi_setopt(multi, CURLMOPT_TIMERDATA, this);
+    curl_multi_setopt(multi, CURLMOPT_MAX_HOST_CONNECTIONS, static_cast<long>(options.maxConnections));
+    curl_multi_setopt(multi, CURLMOPT_MAXCONNECTS, static_cast<long>(options.maxConnections + 2));
+    curl_multi_setopt(multi, CURLMOPT_MAX_CONCURRENT_STREAMS, static_cast<long>(options.maxStreams));
+    curl_multi_setopt(multi, CURLMOPT_PIPELINING, static_cast<long>(CURLPIPE_MULTIPLEX));
+    thread = std::thread([this] {
+        sigset_t all; // signals are for the threads that expect them
+        sigfillset(&all);
+        pthread_sigmask(SIG_SETMASK, &all, nullptr);
+        run();
+    });
+}
+
+CurlTransport::Impl::~Impl() {
+    stopping = true;
+    wake();
+    thread.join();
+    slots.clear();
+    curl_multi_cleanup(multi);
+    close(epoll);
+    close(event);
+}
+
+void CurlTransport::Impl::wake() {
+    const uint64_t one = 1;
+    [[maybe_unused]] const ssize_t written = ::write(event, &one, sizeof one);
+}
+
+void CurlTransport::Impl::enqueue(HttpRequest request, Completion done) {
+    auto job = std::make_unique<HttpJob>();
+    job->request = std::move(request);
+    job->done = std::move(done);
+    job->origin = job->request.url.origin();
+    job->deadline = Steady::now() + inSeconds(job->request.limits.totalSeconds);
+    job->epoch = abortEpoch;
+    if (const std::string why = objection(*job); !why.empty())
+        return fail(std::move(job), TransportError::refused, why);
+    if (aborted || stopping) return fail(std::move(job), TransportError::aborted, "The program is ending.");
+    {
+        std::lock_guard guard(inboxMutex);
+        job->credentials = credentials;
+        inbox.push_back(std::move(job));
+    }
+    if (sleeping.exchange(false)) wake();
+}
+
+int CurlTransport::Impl::onSocket(CURL*, curl_socket_t s, int what, void* self, void* known) {
+    auto* impl = static_cast<Impl*>(self);
+    if (what == CURL_POLL_REMOVE) {
+        epoll_ctl(impl->epoll, EPOLL_CTL_DEL, s, nullptr);
+        return 0;
+    }
+    epoll_event wanted{};
+    wanted.data.fd = s;
+    wanted.events = (what & CURL_POLL_IN ? static_cast<uint32_t>(EPOLLIN) : 0u) |
+                    (what & CURL_POLL_OUT ? static_cast<uint32_t>(EPOLLOUT) : 0u);
+    if (epoll_ctl(impl->epoll, known ? EPOLL_CTL_MOD : EPOLL_CTL_ADD, s, &wanted) != 0)
+        epoll_ctl(impl->epoll, known ? EPOLL_CTL_ADD : EPOLL_CTL_MOD, s, &wanted);
+    curl_multi_assign(impl->multi, s, impl); // marks the socket as known
+    return 0;
+}
+
+int CurlTransport::Impl::onTimer(CURLM*, long milliseconds, void* self) {
+    auto* impl = static_cast<Impl*>(self);
+    if (milliseconds < 0)
+        impl->curlTimer.reset();
+    else
+        impl->curlTimer = Steady::now() + std::chrono::milliseconds(milliseconds);
+    return 0;
+}
+
+void CurlTransport::Impl::run() {
+    while (!stopping) {
+        takeInbox();
+        dropAborted();
+        admit();
+        wait();
+        reap();
+        checkDeadlines();
+    }
+    ++abortEpoch;
+    takeInbox();
+    dropAborted();
+}
+
+void CurlTransport::Impl::wait() {
+    int running = 0;
+    for (int turns = 0; curlTimer && *curlTimer <= Steady::now() && turns < 4; ++turns) {
+        curlTimer.reset();
+        curl_multi_socket_action(multi, CURL_SOCKET_TIMEOUT, 0, &running);
+    }
+    sleeping = true;
+    int timeout = 60000;
+    {
+        std::lock_guard guard(inboxMutex);
+        if (!inbox.empty()) timeout = 0;
+    }
+    const auto until = [&](SteadyTime t) {
+        const auto ms = ceil<milliseconds>(t - Steady::now()).count();
+        timeout = static_cast<int>(std::clamp<int64_t>(ms, 0, timeout));
+    };
+    if (curlTimer) until(*curlTimer);
+    if (!active.empty() || !pending.empty()) until(nextCheck);
+    if (!pending.empty() && notBefore > Steady::now()) until(notBefore);
+    epoll_event events[32];
+    const int n = epoll_wait(epoll, events, 32, timeout);
+    sleeping = false;
+    for (int i = 0; i < n; ++i) {
+        if (events[i].data.fd == event) {
+            uint64_t count;
+            [[maybe_unused]] const ssize_t got = ::read(event, &count, sizeof count);
+            continue;
+        }
+        const uint32_t e = events[i].events;
+        const int mask = (e & EPOLLIN ? CURL_CSELECT_IN : 0) | (e & EPOLLOUT ? CURL_CSELECT_OUT : 0) |
+                         (e & (EPOLLERR | EPOLLHUP) ? CURL_CSELECT_ERR : 0);
+        curl_multi_socket_action(multi, events[i].data.fd, mask, &running);
+    }
+}
+
+void CurlTransport::Impl::takeInbox() {
+    std::vector<std::unique_ptr<HttpJob>> fresh;
+    {
+        std::lock_guard guard(inboxMutex);
+        fresh.swap(inbox);
+    }
+    for (auto& job : fresh) {
+        if (job->epoch < abortEpoch)
+            fail(std::move(job), TransportError::aborted, "The program is ending.");
+        else
+            pending.push_back(std::move(job));
+    }
+}
+
+// Abandons what was handed over before the latest abortAll.
+void CurlTransport::Impl::dropAborted() {
+    const uint64_t epoch = abortEpoch;
+    if (epoch == seenEpoch) return;
+    seenEpoch = epoch;
+    const std::vector<CurlSlot*> running(active.begin(), active.end());
+    for (CurlSlot* slot : running)
+        if (slot->job()->epoch < epoch) end(*slot, TransportError::aborted, "The program is ending.");
+    std::deque<std::unique_ptr<HttpJob>> kept;
+    for (auto& job : pending) {
+        if (job->epoch < epoch)
+            fail(std::move(job), TransportError::aborted, "The program is ending.");
+        else
+            kept.push_back(std::move(job));
+    }
+    pending = std::move(kept);
+}
+
+size_t CurlTransport::Impl::admissionLimit() const {
+    return static_cast<size_t>(http2Origins.empty() ? options.maxConnections : options.maxStreams);
+}
+
+bool CurlTransport::Impl::heldBack(SteadyTime now) { return notBefore > now; }
+
+void CurlTransport::Impl::admit() {
+    if (pending.empty() || heldBack(Steady::now())) return;
+    while (!pending.empty() && active.size() < admissionLimit()) {
+        auto job = std::move(pending.front());
+        pending.pop_front();
+        launch(std::move(job));
+    }
+}
+
+void CurlTransport::Impl::launch(std::unique_ptr<HttpJob> job) {
+    if (idle.empty()) {
+        slots.push_back(std::make_unique<CurlSlot>(options));
+        idle.push_back(slots.back().get());
+    }
+    CurlSlot* slot = idle.back();
+    idle.pop_back();
+    const auto scheme = job->credentials ? job->credentials->scheme : TransportCredentials::Scheme::basic;
+    const bool digest = scheme == TransportCredentials::Scheme::digest ||
+                        (scheme == TransportCredentials::Scheme::automatic && digestOrigins.contains(job->origin));
+    if (active.empty()) nextCheck = Steady::now() + milliseconds(100);
+    slot->prepare(std::move(job), digest);
+    active.insert(slot);
+    ++requests;
+    if (curl_multi_add_handle(multi, slot->easy()) != CURLM_OK)
+        end(*slot, TransportError::unreachable, "The request could not be started.");
+}
+
+void CurlTransport::Impl::reap() {
+    int left = 0;
+    while (CURLMsg* message = curl_multi_info_read(multi, &left)) {
+        if (message->msg != CURLMSG_DONE) continue;
+        const CURLcode code = message->data.result;
+        CurlSlot* slot = nullptr;
+        curl_easy_getinfo(message->easy_handle, CURLINFO_PRIVATE, &slot);
+        finished(*slot, code);
+    }
+}
+
+void CurlTransport::Impl::detach(CurlSlot& slot) {
+    curl_multi_remove_handle(multi, slot.easy());
+    active.erase(&slot);
+    idle.push_back(&slot);
+}
+
+void CurlTransport::Impl::finished(CurlSlot& slot, CURLcode code) {
+    long opened = 0, version = 0;
+    curl_easy_getinfo(slot.easy(), CURLINFO_NUM_CONNECTS, &opened);
+    curl_easy_getinfo(slot.easy(), CURLINFO_HTTP_VERSION, &version);
+    connections += static_cast<uint64_t>(opened);
+    detach(slot);
+    auto job = slot.release();
+    if (version == CURL_HTTP_VERSION_2_0)
+        http2Origins.insert(job->origin);
+    else if (code == CURLE_OK && !http2Origins.empty())
+        http2Origins.erase(job->origin);
+    if (code != CURLE_OK) {
+        const TransportError error = job->verdict != TransportError::none ? job->verdict : translated(code);
+        const std::string detail = job->verdict != TransportError::none ? job->verdictDetail : curl_easy_strerror(code);
+        return fail(std::move(job), error, detail);
+    }
+    if (sendAgain(job)) return;
+    auto done = std::move(job->done);
+    done(std::move(job->response));
+}
+
+// Puts the job back in the queue when the answer asks for another try; true when it did.
+bool CurlTransport::Impl::sendAgain(std::unique_ptr<HttpJob>& job) {
+    const int status = job->response.status;
+    if (status == 401) {
+        ++challenged;
+        const bool automatic = job->mayCarryCredentials() &&
+                               job->credentials->scheme == TransportCredentials::Scheme::automatic;
+        if (!automatic || job->repetitions > 0 || !wantsDigest(job->response)) return false;
+        digestOrigins.insert(job->origin);
+    } else if (status == 503 || status == 429) {
+        const auto seconds = retryAfterSeconds(job->response);
+        if (!seconds) return false;
+        const SteadyTime until = Steady::now() + inSeconds(std::min(*seconds, options.maxRetryAfterSeconds));
+        notBefore = std::max(notBefore, until);
+        if (job->repetitions > 0 || until >= job->deadline) return false;
+        ++heldBackCount;
+    } else {
+        return false;
+    }
+    ++job->repetitions;
+    pending.push_front(std::move(job));
+    return true;
+}
+
+void CurlTransport::Impl::checkDeadlines() {
+    const SteadyTime now = Steady::now();
+    if (now < nextCheck) return;
+    nextCheck = now + milliseconds(100);
+    std::vector<std::pair<CurlSlot*, std::string>> late;
+    for (CurlSlot* slot : active) {
+        const HttpLimits& limits = slot->job()->request.limits;
+        if (slot->job()->deadline <= now)
+            late.emplace_back(slot, "No complete answer within " + std::to_string(limits.totalSeconds) + " s.");
+        else if (slot->isIdle(now))
+            late.emplace_back(slot, "Not a byte moved for " + std::to_string(limits.idleSeconds) + " s.");
+    }
+    for (auto& [slot, detail] : late) end(*slot, TransportError::timedOut, detail);
+    // Whoever cannot be served before the deadline hears it now.
+    std::deque<std::unique_ptr<HttpJob>> kept;
+    for (auto& job : pending) {
+        if (job->deadline <= std::max(now, notBefore))
+            fail(std::move(job), TransportError::timedOut, "The store could not take the request in time.");
+        else
+            kept.push_back(std::move(job));
+    }
+    pending = std::move(kept);
+}
+
+void CurlTransport::Impl::end(CurlSlot& slot, TransportError error, std::string detail) {
+    detach(slot);
+    fail(slot.release(), error, std::move(detail));
+}
+
+void CurlTransport::Impl::fail(std::unique_ptr<HttpJob> job, TransportError error, std::string detail) {
+    HttpResponse answer;
+    answer.error = error;
+    answer.detail = std::move(detail);
+    job->done(std::move(answer));
+}
+
+CurlTransport::CurlTransport(CurlTransportOptions options) : _impl(std::make_unique<Impl>(std::move(options))) {}
+CurlTransport::~CurlTransport() = default;
+
+HttpResponse CurlTransport::perform(HttpRequest request) {
+    struct Waiting {
+        std::mutex mutex;
+        std::condition_variable changed;
+        std::optional<HttpResponse> answer;
+    };
+    auto waiting = std::make_shared<Waiting>();
+    _impl->enqueue(std::move(request), [waiting](HttpResponse answer) {
+        std::lock_guard guard(waiting->mutex);
+        waiting->answer = std::move(answer);
+        waiting->changed.notify_one();
+    });
+    // The transport's thread answers every request by its deadline.
+    std::unique_lock lock(waiting->mutex);
+    waiting->changed.wait(lock, [&] { return waiting->answer.has_value(); });
+    return std::move(*waiting->answer);
+}
+
+void CurlTransport::start(HttpRequest request, Completion done) { _impl->enqueue(std::move(request), std::move(done)); }
+
+void CurlTransport::abortAll() {
+    _impl->aborted = true;
+    ++_impl->abortEpoch;
+    _impl->wake();
+}
+
+void CurlTransport::resume() { _impl->aborted = false; }
+
+void CurlTransport::setCredentials(std::optional<TransportCredentials> credentials) {
+    auto fresh = credentials ? std::make_shared<const TransportCredentials>(std::move(*credentials)) : nullptr;
+    std::lock_guard guard(_impl->inboxMutex);
+    _impl->credentials = std::move(fresh);
+}
+
+CurlTransport::Statistics CurlTransport::statistics() const {
+    return {_impl->requests, _impl->connections, _impl->challenged, _impl->heldBackCount};
+}
+
+} // namespace rolvane

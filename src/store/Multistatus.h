@@ -1,0 +1,56 @@
+#pragma once
+
+#include "foundation/Date.h"
+#include "foundation/StrongString.h"
+
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace rolvane {
+
+// One `response` of a multistatus body (RFC 4918 section 14.24), with the properties that a listing asks for.
+// Properties are taken from propstats of status 200 only.
+struct MultistatusEntry {
+    std::string href; // as the server wrote it, surrounding white space dropped
+    int status = 0;   // the response's own status, 0 when it has propstats instead
+    bool isCollection = false;
+    std::optional<Date> lastModified;
+    std::optional<uint64_t> length;
+    EntityTag etag;
+};
+
+struct MultistatusLimits {
+    int maxDepth = 32;
+    size_t maxEntries = 1000000;
+    size_t maxText = 16384; // of one href or property
+};
+
+// Reads a multistatus body piece by piece (libxml2 SAX; no DTD, no entities of the document's own, no network). What
+// it has read counts only when `finish` says so: a truncated body is nothing. One thread.
+class MultistatusReader {
+public:
+    explicit MultistatusReader(MultistatusLimits limits = {});
+    ~MultistatusReader();
+
+    bool feed(std::string_view bytes); // false once the body cannot be good any more; further calls do nothing
+    // The entries in the server's order; nothing when the body is not one whole, well-formed multistatus.
+    std::optional<std::vector<MultistatusEntry>> finish();
+
+    struct Impl;
+
+private:
+    std::unique_ptr<Impl> _impl;
+};
+
+// What a LOCK answer grants (RFC 4918 section 9.10): the active lock's token and timeout.
+struct LockGrant {
+    LockToken token;                     // empty when the body names none
+    std::optional<double> timeoutSeconds; // nothing: infinite or not said
+};
+// Nothing when the text is not one well-formed document. At most 1 MiB is looked at.
+std::optional<LockGrant> parseLockAnswer(std::string_view body);
+
+} // namespace rolvane

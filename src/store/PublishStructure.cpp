@@ -1,0 +1,130 @@
+#include "store/PublishStructure.h"
+
+#include "foundation/Log.h"
+#include "foundation/Paths.h"
+#include "foundation/PropertyList.h"
+#include "store/StoreListing.h"
+
+#include <set>
+
+namespace rolvane {
+
+namespace {
+
+constexpr int kBuckets = 32;
+
+std::set<std::string> collectionsIn(const StoreListing::Members& members) {
+    std::set<std::string> out;
+    for (const auto& [name, entry] : *members.entries)
+        if (entry.isCollection) out.insert(name.cxLastComponent());
+    return out;
+}
+
+bool hasFile(const StoreListing::Members& members, std::string_view wanted) {
+    for (const auto& [name, entry] : *members.entries)
+        if (!entry.isCollection && name.cxLastComponent() == wanted) return true;
+    return false;
+}
+
+std::vector<int> allBuckets() {
+    std::vector<int> out(kBuckets);
+    for (int i = 0; i < kBuckets; ++i) out[static_cast<size_t>(i)] = i;
+    return out;
+}
+
+} // namespace
+
+// `everything`: the buckets are listed too, at the same time.
+PublishStructure::Missing PublishStructure::look(bool everything) {
+    VersionMemory unused;
+    StoreListing listing(_session, unused);
+    std::vector<Url> wanted{base()};
+    if (everything) wanted.push_back(base().cxURLByAppendingComponent("People"));
+    const auto found = listing.members(wanted);
+    Missing m;
+    if (found[0].code == 404) return {true, true, true, true, true, allBuckets()};
+    if (!found[0].entries) return m;
+    m.known = true;
+    m.people = !collectionsIn(found[0]).contains("People");
+    m.info = !hasFile(found[0], "info");
+    m.dateFile = !hasFile(found[0], "dateFile");
+    if (m.people) {
+        m.buckets = allBuckets();
+    } else if (everything) {
+        if (!found[1].entries) return {};
+        const auto present = collectionsIn(found[1]);
+        for (const int bucket : allBuckets())
+            if (!present.contains(std::to_string(bucket))) m.buckets.push_back(bucket);
+    }
+    return m;
+}
+
+bool PublishStructure::check(bool create) {
+    std::lock_guard guard(_mutex);
+    Missing missing = look(_doubtful);
+    if (!missing.known) return false;
+    if (!missing.anything()) {
+        _doubtful = false;
+        return true;
+    }
+    _doubtful = true;
+    if (!create) return false;
+    // Something is missing: it may be more than the first look showed.
+    if (!missing.tree && !missing.people) missing = look(true);
+    if (!missing.known || !complete(missing)) return false;
+    _doubtful = false;
+    return true;
+}
+
+bool PublishStructure::repair() {
+    _doubtful = true;
+    return check(true);
+}
+
+bool PublishStructure::makeTree() {
+    const Url tree = base();
+    if (_files.makeCollection(tree)) return true;
+    // The folders above belong to whoever runs the store; those that are missing are made, from the top.
+    const Url bytes = *_session.endpoint(tree);
+    std::vector<Url> above;
+    for (Url u = bytes.cxURLByDeletingLastComponent(); !u.cxLastComponent().empty(); u = u.cxURLByDeletingLastComponent())
+        above.insert(above.begin(), u);
+    for (const Url& u : above) _session.send(StoreSession::request("MKCOL", u));
+    return _files.makeCollection(tree);
+}
+
+// All at once; one that exists already, because somebody else makes the structure too, is as good.
+bool PublishStructure::makeAll(const std::vector<Url>& collections) {
+    std::vector<HttpRequest> requests;
+    for (const Url& name : collections) requests.push_back(StoreSession::request("MKCOL", *_session.endpoint(name)));
+    const auto answers = _session.sendAll(std::move(requests));
+    for (const HttpResponse& answer : answers)
+        if (!answer.ok() && answer.status != 405) return false;
+    return true;
+}
+
+// A file that must not replace another one.
+bool PublishStructure::writeNew(const Url& name, const std::string& text) {
+    HttpRequest request = StoreSession::request("PUT", *_session.endpoint(name));
+    request.headers = {{"If-None-Match", "*"}, {"Content-Type", "application/xml; charset=utf-8"}};
+    request.body = std::make_shared<const std::string>(text);
+    const HttpResponse answer = _session.send(std::move(request));
+    return answer.ok() || answer.status == 412;
+}
+
+bool PublishStructure::complete(const Missing& missing) {
+    const Url people = base().cxURLByAppendingComponent("People");
+    if (missing.tree && !makeTree()) return false;
+    if (missing.people && !makeAll({people})) return false;
+    std::vector<Url> buckets;
+    for (const int bucket : missing.buckets) buckets.push_back(people.cxURLByAppendingComponent(std::to_string(bucket)));
+    if (!buckets.empty() && !makeAll(buckets)) return false;
+    if (missing.dateFile && !writeNew(base().cxURLByAppendingComponent("dateFile"), "why")) return false;
+    if (missing.info) {
+        const Dictionary info{{"SerialNumber", makeUUID()}};
+        if (!writeNew(base().cxURLByAppendingComponent("info"), PropertyList::toXML(info))) return false;
+    }
+    return true;
+}
+
+} // namespace rolvane

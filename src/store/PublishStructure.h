@@ -1,0 +1,42 @@
+#pragma once
+
+#include "store/StoreFiles.h"
+#include "store/StoreSession.h"
+
+#include <atomic>
+#include <mutex>
+
+namespace rolvane {
+
+// The tree that a publisher needs on the store: the tree itself, "People" with its buckets "0" to "31", "dateFile" and
+// "info". They are made in this order, so that a tree that has "info" was once complete, and one listing tells it; when
+// a write finds a folder missing, everything is looked at. Any thread.
+class PublishStructure {
+public:
+    PublishStructure(StoreSession& session, StoreFiles& files) : _session(session), _files(files) {}
+
+    bool check(bool create);
+    // After a write found a folder missing: makes what is missing. One thread at a time does it, the others wait.
+    bool repair();
+
+private:
+    struct Missing {
+        bool known = false; // the store gave an answer that can be believed
+        bool tree = false, people = false, dateFile = false, info = false;
+        std::vector<int> buckets;
+        bool anything() const { return tree || people || dateFile || info || !buckets.empty(); }
+    };
+    Missing look(bool everything);
+    bool complete(const Missing& missing);
+    bool makeTree();
+    bool makeAll(const std::vector<Url>& collections);
+    bool writeNew(const Url& name, const std::string& text);
+    Url base() const { return _session.account().baseLocationFor(_session.account().user); }
+
+    StoreSession& _session;
+    StoreFiles& _files;
+    std::mutex _mutex; // one completion at a time
+    std::atomic<bool> _doubtful{false};
+};
+
+} // namespace rolvane

@@ -1,0 +1,290 @@
+#include "store/StoreFiles.h"
+
+#include "foundation/CXException.h"
+#include "foundation/Log.h"
+#include "foundation/PropertyList.h"
+#include "store/Multistatus.h"
+
+namespace rolvane {
+
+namespace {
+
+constexpr std::string_view kMakingSuffix = ".making";
+constexpr size_t kMaxKnownCollections = 20000;
+
+// The dictionary that a thread read last, and what its next write to the same place has to find there.
+struct ReadMark {
+    const void* reader = nullptr;
+    Url name, target;
+    enum class State { unknown, absent, present } state = State::unknown;
+    EntityTag etag;
+};
+thread_local ReadMark lastRead;
+
+ReadMark takeMark(const void* reader, const Url& name) {
+    ReadMark mark = std::move(lastRead);
+    lastRead = {};
+    return mark.reader == reader && mark.name == name ? mark : ReadMark();
+}
+
+bool mayBeBoth(const Url& name) { return name.encodedPath().ends_with("CXGroup"); }
+
+Url stateURL(const Url& collection) { return collection.cxURLByAppendingComponent(CXDAVManager::kStateName); }
+
+bool isHtml(const HttpResponse& answer) {
+    const std::string* type = answer.header("content-type");
+    return type && type->find("html") != std::string::npos;
+}
+
+FileVersion versionOf(const HttpResponse& answer) {
+    FileVersion v;
+    if (const std::string* tag = answer.header("etag")) v.etag = EntityTag(*tag);
+    if (const std::string* date = answer.header("last-modified")) v.lastModified = Date::fromHTTP(*date);
+    v.size = answer.body.size();
+    return v;
+}
+
+// The headers that make a write depend on what was read. A weak tag cannot be used with If-Match (RFC 9110 section
+// 13.1.1), but WebDAV's own If header compares weakly.
+std::vector<std::pair<std::string, std::string>> conditions(const ReadMark& mark, const LockToken& token) {
+    std::vector<std::pair<std::string, std::string>> out;
+    std::string state = token.empty() ? "" : "<" + token.str() + ">";
+    if (mark.reader && mark.state == ReadMark::State::absent) out.emplace_back("If-None-Match", "*");
+    if (mark.reader && mark.state == ReadMark::State::present && !mark.etag.empty()) {
+        if (mark.etag.str().starts_with("W/"))
+            state += (state.empty() ? "[" : " [") + mark.etag.str() + "]";
+        else
+            out.emplace_back("If-Match", mark.etag.str());
+    }
+    if (!state.empty()) out.emplace_back("If", "(" + state + ")");
+    return out;
+}
+
+std::string contentType(const std::string& text) {
+    return text.starts_with("<?xml") ? "application/xml; charset=utf-8" : "text/plain; charset=utf-8";
+}
+
+} // namespace
+
+StoreFiles::StoreFiles(StoreSession& session, LockTokens& tokens, VersionMemory& versions)
+    : _session(session), _tokens(tokens), _versions(versions) {}
+
+bool StoreFiles::isReservedName(std::string_view name) {
+    return name == CXDAVManager::kStateName || name.ends_with(kMakingSuffix);
+}
+
+bool StoreFiles::knownCollection(const Url& url) const {
+    std::lock_guard guard(_mutex);
+    return !_collections.empty() && _collections.contains(url.absoluteString());
+}
+
+void StoreFiles::remember(const Url& url) {
+    std::lock_guard guard(_mutex);
+    if (_collections.size() >= kMaxKnownCollections) _collections.clear();
+    _collections.insert(url.absoluteString());
+}
+
+void StoreFiles::forget(const Url& url) {
+    std::lock_guard guard(_mutex);
+    _collections.erase(url.absoluteString());
+}
+
+// ---- reading
+
+StoreFiles::Fetched StoreFiles::fetch(const Url& url, bool mayBeCollection) {
+    HttpResponse answer = _session.send(StoreSession::request("GET", url));
+    Fetched out;
+    out.code = answer.status;
+    if (!answer.complete()) return out;
+    if (answer.status == 404) {
+        out.found = Found::absent;
+    } else if (mayBeCollection && ((answer.status >= 300 && answer.status < 400) || answer.status == 403 ||
+                                   answer.status == 405 || (answer.status == 200 && isHtml(answer)))) {
+        out.found = Found::perhapsCollection;
+    } else if (answer.status == 200) {
+        out.version = versionOf(answer);
+        out.found = Found::noDictionary;
+        try {
+            const Value value = PropertyList::fromXML(answer.body);
+            if (const Dictionary* d = value.dictionaryIf()) {
+                out.dictionary = *d;
+                out.found = Found::dictionary;
+            }
+        } catch (const CXException& e) {
+            CXDLog("No dictionary at %@: %@", url, e.reason());
+        }
+    }
+    return out;
+}
+
+// Looks at the path itself and into the collection that may be there, the likelier one first. `target` becomes the
+// place that a following write has to go to.
+StoreFiles::Fetched StoreFiles::fetchEither(const Url& url, Url& target) {
+    const Url state = stateURL(url);
+    const bool known = knownCollection(url);
+    target = known ? state : url;
+    Fetched first = fetch(target, !known);
+    if (first.found != Found::absent && first.found != Found::perhapsCollection) return first;
+    const Url other = known ? url : state;
+    Fetched second = fetch(other, known);
+    if (known) { // nothing inside the collection: either it holds no state yet, or it has given way to a file
+        if (second.found == Found::dictionary || second.found == Found::noDictionary) {
+            forget(url);
+            target = url;
+            return second;
+        }
+        if (second.found == Found::absent) forget(url);
+        return second.found == Found::failed ? second : first;
+    }
+    if (second.found != Found::absent) {
+        if (second.found != Found::failed) remember(url);
+        target = state;
+        return second;
+    }
+    if (first.found == Found::perhapsCollection) {
+        const Kind kind = kindOf(url);
+        if (kind != Kind::collection) return first;
+        remember(url);
+        target = state;
+    }
+    return second;
+}
+
+// Keeps what a following write of this thread has to find.
+void StoreFiles::note(const Url& name, const Url& target, const Fetched& fetched) {
+    lastRead = {this, name, target, ReadMark::State::unknown, fetched.version.etag};
+    if (fetched.found == Found::absent) {
+        lastRead.state = ReadMark::State::absent;
+        _versions.forget(name.absoluteString());
+    } else if (fetched.found == Found::dictionary || fetched.found == Found::noDictionary) {
+        lastRead.state = ReadMark::State::present;
+        _versions.read(name.absoluteString(), fetched.version);
+    }
+}
+
+StoreFiles::Reading StoreFiles::read(const Url& name, bool securely) {
+    lastRead = {};
+    const auto url = _session.endpoint(name, securely);
+    if (!url) return {};
+    Url target = *url;
+    Fetched fetched = mayBeBoth(name) ? fetchEither(*url, target) : fetch(*url, false);
+    note(name, target, fetched);
+    return {fetched.code, std::move(fetched.dictionary)};
+}
+
+std::optional<Date> StoreFiles::modificationDate(const Url& name) {
+    const auto url = _session.endpoint(name);
+    if (!url) return std::nullopt;
+    const Url target = mayBeBoth(name) && knownCollection(*url) ? stateURL(*url) : *url;
+    const HttpResponse answer = _session.send(StoreSession::request("HEAD", target));
+    if (answer.ok())
+        if (const std::string* date = answer.header("last-modified")) return Date::fromHTTP(*date);
+    if (!answer.complete() || answer.status == 404) return std::nullopt;
+    MultistatusReader reader;
+    const HttpResponse found = _session.send(StoreSession::propfind(target, 0));
+    if (found.status != 207 || !reader.feed(found.body)) return std::nullopt;
+    const auto entries = reader.finish();
+    return entries && entries->size() == 1 ? entries->front().lastModified : std::nullopt;
+}
+
+// ---- writing
+
+int StoreFiles::put(const Url& name, const Url& target, const std::shared_ptr<const std::string>& body,
+                    std::vector<std::pair<std::string, std::string>> headers) {
+    HttpRequest request = StoreSession::request("PUT", target);
+    headers.emplace_back("Content-Type", contentType(*body));
+    request.headers = std::move(headers);
+    request.body = body;
+    const HttpResponse answer = _session.send(std::move(request));
+    if (answer.ok()) {
+        const std::string* tag = answer.header("etag");
+        const std::string* date = answer.header("date");
+        _versions.wrote(name.absoluteString(), tag ? EntityTag(*tag) : EntityTag(),
+                        date ? Date::fromHTTP(*date) : std::nullopt, body->size());
+    }
+    return answer.status;
+}
+
+int StoreFiles::write(const Url& name, std::string text, bool securely, const std::function<bool()>& repair) {
+    ReadMark mark = takeMark(this, name);
+    const auto url = _session.endpoint(name, securely);
+    if (!url) return 0;
+    if (mark.reader && mark.state == ReadMark::State::unknown) return 0;
+    const bool both = mayBeBoth(name);
+    const Url state = both ? stateURL(*url) : Url();
+    const Url first = both && knownCollection(*url) ? state : *url;
+    const auto body = std::make_shared<const std::string>(std::move(text));
+    const auto attempt = [&](const Url& target) {
+        return put(name, target, body, conditions(mark, _tokens.tokenFor(target.absoluteString())));
+    };
+    const int code = attempt(first);
+    if (succeeded(code) || code == 0) return code;
+    if (both && first == state && (code == 409 || code == 404 || code == 400)) { // the collection is gone
+        forget(*url);
+        return attempt(*url);
+    }
+    const bool mayBeInTheWay = code == 409 || code == 405 || code == 412 || (code >= 300 && code < 400);
+    if (both && first == *url && mayBeInTheWay && kindOf(*url) == Kind::collection) {
+        remember(*url);
+        return attempt(state);
+    }
+    if ((code == 409 || code == 404) && repair && repair()) return attempt(first);
+    return code;
+}
+
+int StoreFiles::remove(const Url& name) {
+    const auto url = _session.endpoint(name);
+    if (!url) return 0;
+    forget(*url);
+    _versions.forget(name.absoluteString());
+    HttpRequest request = StoreSession::request("DELETE", *url);
+    const LockToken token = _tokens.tokenFor(url->absoluteString());
+    if (!token.empty()) request.headers.emplace_back("If", "(<" + token.str() + ">)");
+    return _session.send(std::move(request)).status;
+}
+
+// ---- collections
+
+StoreFiles::Kind StoreFiles::kindOf(const Url& url) {
+    const HttpResponse answer = _session.send(StoreSession::propfind(url, 0));
+    if (answer.status == 404) return Kind::absent;
+    MultistatusReader reader;
+    if (answer.status != 207 || !reader.feed(answer.body)) return Kind::unknown;
+    const auto entries = reader.finish();
+    if (!entries || entries->size() != 1) return Kind::unknown;
+    return entries->front().isCollection ? Kind::collection : Kind::file;
+}
+
+bool StoreFiles::makeCollection(const Url& name) {
+    const auto url = _session.endpoint(name);
+    if (!url) return false;
+    const HttpResponse answer = _session.send(StoreSession::request("MKCOL", *url));
+    if (answer.status == 405 && knownCollection(*url)) return true;
+    if (answer.ok()) {
+        remember(*url);
+        return true;
+    }
+    if (answer.status != 405 && answer.status != 409 && (answer.status < 300 || answer.status >= 400)) return false;
+    const Kind kind = kindOf(*url);
+    if (kind == Kind::file && !moveIntoCollection(*url)) return false;
+    if (kind != Kind::collection && kind != Kind::file) return false;
+    remember(*url);
+    return true;
+}
+
+// The new collection is made beside the file, gets a copy of it as its state, and then takes its place in one request:
+// at no moment is the state missing.
+bool StoreFiles::moveIntoCollection(const Url& url) {
+    const Url making = url.cxURLByDeletingLastComponent().cxURLByAppendingComponent(url.cxLastComponent() +
+                                                                                    std::string(kMakingSuffix));
+    const HttpResponse made = _session.send(StoreSession::request("MKCOL", making));
+    if (!made.ok() && made.status != 405) return false;
+    HttpRequest copy = StoreSession::request("COPY", url);
+    copy.headers = {{"Destination", stateURL(making).absoluteString()}, {"Overwrite", "T"}, {"Depth", "0"}};
+    if (!_session.send(std::move(copy)).ok()) return false;
+    HttpRequest move = StoreSession::request("MOVE", making);
+    move.headers = {{"Destination", url.absoluteString()}, {"Overwrite", "T"}};
+    return _session.send(std::move(move)).ok();
+}
+
+} // namespace rolvane

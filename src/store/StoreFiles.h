@@ -1,0 +1,69 @@
+#pragma once
+
+#include "foundation/Value.h"
+#include "store/LockTokens.h"
+#include "store/StoreSession.h"
+#include "store/VersionMemory.h"
+
+#include <functional>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <unordered_set>
+
+namespace rolvane {
+
+// Reads, writes and removes the files of a store, names in, HTTP status codes out (0: no believable answer).
+// Resolves paths that are a group's state file and its directory at once, and makes the write that follows a read
+// conditional. Any thread.
+class StoreFiles {
+public:
+    StoreFiles(StoreSession& session, LockTokens& tokens, VersionMemory& versions);
+
+    struct Reading {
+        int code = 0;
+        std::optional<Dictionary> dictionary;
+    };
+    Reading read(const Url& name, bool securely);
+    // `repair` is called when a folder on the way to the file is missing; true: worth another try.
+    int write(const Url& name, std::string text, bool securely, const std::function<bool()>& repair = {});
+    int remove(const Url& name);
+    std::optional<Date> modificationDate(const Url& name);
+
+    // True when the collection is there afterwards. A file in its way is moved into it.
+    bool makeCollection(const Url& name);
+
+    static bool succeeded(int code) { return code >= 200 && code < 300 && code != 207; }
+    // True for names that the store's own bookkeeping uses and listings hide.
+    static bool isReservedName(std::string_view name);
+
+private:
+    enum class Found { dictionary, noDictionary, absent, perhapsCollection, failed };
+    struct Fetched {
+        Found found = Found::failed;
+        int code = 0;
+        std::optional<Dictionary> dictionary;
+        FileVersion version;
+    };
+    Fetched fetch(const Url& url, bool mayBeCollection);
+    Fetched fetchEither(const Url& url, Url& target);
+    void note(const Url& name, const Url& target, const Fetched& fetched);
+
+    int put(const Url& name, const Url& target, const std::shared_ptr<const std::string>& body,
+            std::vector<std::pair<std::string, std::string>> headers);
+    enum class Kind { absent, file, collection, unknown };
+    Kind kindOf(const Url& url);
+    bool moveIntoCollection(const Url& url);
+
+    bool knownCollection(const Url& url) const;
+    void remember(const Url& url);
+    void forget(const Url& url);
+
+    StoreSession& _session;
+    LockTokens& _tokens;
+    VersionMemory& _versions;
+    mutable std::mutex _mutex; // guards _collections
+    std::unordered_set<std::string> _collections; // endpoints known to be collections; a cache
+};
+
+} // namespace rolvane

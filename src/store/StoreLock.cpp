@@ -1,0 +1,224 @@
+#include "store/StoreLock.h"
+
+#include "foundation/CXException.h"
+#include "foundation/Log.h"
+#include "foundation/Paths.h"
+#include "store/CXDAVManagerImpl.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <cstdio>
+#include <signal.h>
+#include <unistd.h>
+
+namespace rolvane {
+
+// ---- ledger
+
+LockLedger LockLedger::user() {
+    try {
+        return LockLedger(stateDirectory() + "/locks");
+    } catch (const CXException& e) {
+        CXLog("Lock tokens are not written down: %@", e.reason());
+        return LockLedger("");
+    }
+}
+
+std::string LockLedger::pathFor(const std::string& url) const {
+    uint64_t h = 0xcbf29ce484222325u;
+    for (const char c : url) h = (h ^ static_cast<unsigned char>(c)) * 0x100000001b3u;
+    char name[32];
+    snprintf(name, sizeof name, "/%016llx", static_cast<unsigned long long>(h));
+    return _directory + name;
+}
+
+// The file: process id, URL and token, a line each.
+void LockLedger::note(const std::string& url, const LockToken& token) {
+    if (_directory.empty()) return;
+    try {
+        CXPathUtils_MakeCompletePath(_directory, 0700);
+        writeFileDurably(pathFor(url), std::to_string(getpid()) + "\n" + url + "\n" + token.str() + "\n");
+    } catch (const CXException& e) {
+        CXDLog("A lock token is not written down: %@", e.reason());
+    }
+}
+
+void LockLedger::strike(const std::string& url) {
+    if (!_directory.empty()) ::unlink(pathFor(url).c_str());
+}
+
+std::optional<LockToken> LockLedger::orphan(const std::string& url) const {
+    if (_directory.empty()) return std::nullopt;
+    const std::string path = pathFor(url);
+    if (access(path.c_str(), R_OK) != 0) return std::nullopt;
+    try {
+        const std::string text = readFile(path, 16384);
+        const size_t first = text.find('\n'), second = text.find('\n', first + 1), third = text.find('\n', second + 1);
+        if (third == std::string::npos || text.substr(first + 1, second - first - 1) != url) return std::nullopt;
+        const int pid = atoi(text.c_str());
+        if (pid > 0 && pid != getpid() && (kill(pid, 0) == 0 || errno == EPERM)) return std::nullopt;
+        return LockToken(text.substr(second + 1, third - second - 1));
+    } catch (const CXException&) {
+        return std::nullopt;
+    }
+}
+
+// ---- lock
+
+namespace {
+
+std::string escaped(const std::string& text) {
+    std::string out;
+    for (const char c : text) {
+        if (c == '&')
+            out += "&amp;";
+        else if (c == '<')
+            out += "&lt;";
+        else
+            out += c;
+    }
+    return out;
+}
+
+// Lock-Token: <urn:...> (RFC 4918 section 10.5)
+LockToken tokenInHeader(const HttpResponse& answer) {
+    const std::string* text = answer.header("lock-token");
+    if (!text || text->size() < 3 || text->front() != '<' || text->back() != '>') return {};
+    return LockToken(text->substr(1, text->size() - 2));
+}
+
+bool isPlausible(const LockToken& token) {
+    return !token.empty() && token.str().size() < 1024 && token.str().find_first_of("<>\r\n ") == std::string::npos;
+}
+
+} // namespace
+
+StoreLock::StoreLock(std::shared_ptr<CXDAVManager::Impl> client, Url name, LockLedger ledger)
+    : _client(client), _name(std::move(name)), _endpoint(client->session.endpoint(_name)), _ledger(std::move(ledger)) {}
+
+// A LOCK request: a new lock, or the refresh of the token's.
+HttpResponse StoreLock::ask(const LockToken& refreshed) {
+    const auto client = _client.lock();
+    if (!client || !_endpoint) return {};
+    HttpRequest r = StoreSession::request("LOCK", *_endpoint);
+    r.headers = {{"Timeout", "Second-" + std::to_string(static_cast<int>(lockTimeout()))}};
+    if (!refreshed.empty()) {
+        r.headers.emplace_back("If", "(<" + refreshed.str() + ">)");
+    } else {
+        r.headers.emplace_back("Depth", "0");
+        r.headers.emplace_back("Content-Type", "application/xml; charset=utf-8");
+        r.body = std::make_shared<const std::string>(
+            "<?xml version=\"1.0\" encoding=\"utf-8\"?>\n<lockinfo xmlns=\"DAV:\"><lockscope><exclusive/></lockscope>"
+            "<locktype><write/></locktype><owner>" +
+            escaped(client->session.account().user.str()) + "</owner></lockinfo>");
+    }
+    return client->session.send(std::move(r));
+}
+
+// Keeps what the answer grants; false when it grants nothing.
+bool StoreLock::take(const HttpResponse& answer, const LockToken& known) {
+    if (!answer.ok()) return false;
+    const auto grant = parseLockAnswer(answer.body);
+    if (!grant) return false;
+    LockToken token = tokenInHeader(answer);
+    if (token.empty()) token = known.empty() ? grant->token : known;
+    if (!isPlausible(token)) return false;
+    const double seconds = std::clamp(grant->timeoutSeconds.value_or(lockTimeout()), 1.0, 86400.0);
+    {
+        std::lock_guard guard(_mutex);
+        _token = token;
+        _expires = Clock::system().now().addingSeconds(seconds);
+    }
+    if (const auto client = _client.lock()) client->tokens.set(_endpoint->absoluteString(), token);
+    return true;
+}
+
+void StoreLock::lose() {
+    LockToken token;
+    {
+        std::lock_guard guard(_mutex);
+        std::swap(token, _token);
+    }
+    if (token.empty() || !_endpoint) return;
+    if (const auto client = _client.lock()) client->tokens.drop(_endpoint->absoluteString(), token);
+    _ledger.strike(_endpoint->absoluteString());
+}
+
+bool StoreLock::tryLock() {
+    std::lock_guard calls(_calls);
+    if (locked()) return true;
+    if (!_endpoint) return false;
+    const std::string where = _endpoint->absoluteString();
+    HttpResponse answer = ask({});
+    if (answer.status == 423) { // perhaps by an earlier run of ours that did not come to release it
+        const auto orphan = _ledger.orphan(where);
+        if (!orphan || !isPlausible(*orphan)) return false;
+        if (!take(ask(*orphan), *orphan)) return false;
+        CXDLog("Took over the lock on %@ of an earlier run", _name);
+    } else if (!take(answer, {})) {
+        return false;
+    }
+    LockToken token;
+    {
+        std::lock_guard guard(_mutex);
+        token = _token;
+    }
+    _ledger.note(where, token);
+    return true;
+}
+
+bool StoreLock::renew() {
+    std::lock_guard calls(_calls);
+    LockToken token;
+    {
+        std::lock_guard guard(_mutex);
+        token = _token;
+    }
+    if (token.empty()) return false;
+    if (take(ask(token), token)) return true;
+    lose();
+    return false;
+}
+
+void StoreLock::unlock() {
+    std::lock_guard calls(_calls);
+    LockToken token;
+    {
+        std::lock_guard guard(_mutex);
+        token = _token;
+    }
+    if (token.empty()) return;
+    if (const auto client = _client.lock()) {
+        HttpRequest r = StoreSession::request("UNLOCK", *_endpoint);
+        r.headers = {{"Lock-Token", "<" + token.str() + ">"}};
+        const HttpResponse answer = client->session.send(std::move(r));
+        if (!answer.complete()) { // it expires by itself; the note lets a later run take it over
+            std::lock_guard guard(_mutex);
+            _token = LockToken();
+            client->tokens.drop(_endpoint->absoluteString(), token);
+            return;
+        }
+    }
+    lose();
+}
+
+bool StoreLock::locked() const {
+    std::lock_guard guard(_mutex);
+    return !_token.empty();
+}
+
+Date StoreLock::expires() const {
+    std::lock_guard guard(_mutex);
+    return _token.empty() ? Clock::system().now().addingSeconds(lockTimeout()) : _expires;
+}
+
+std::shared_ptr<CXWebDAVLock> makeStoreLock(CXDAVManager& manager, const Url& url) {
+    return std::make_shared<StoreLock>(manager.impl(), url, LockLedger::user());
+}
+
+std::shared_ptr<CXWebDAVLock> CXWebDAVLock::initWithURL(const Url& url) {
+    if (url.scheme() == "file") return makeFileLock(url);
+    return makeStoreLock(CXDAVManager::defaultManager(), url);
+}
+
+} // namespace rolvane

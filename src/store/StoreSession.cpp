@@ -1,0 +1,221 @@
+#include "store/StoreSession.h"
+
+#include "foundation/CXException.h"
+#include "foundation/Log.h"
+
+#include <utility>
+
+namespace rolvane {
+
+namespace {
+
+constexpr int64_t kBeliefMilliseconds = 30000;
+
+int64_t steadyMilliseconds() {
+    using namespace std::chrono;
+    return duration_cast<milliseconds>(steady_clock::now().time_since_epoch()).count() + 1;
+}
+
+TransportCredentials::Scheme schemeOf(Authentication a) {
+    switch (a) {
+    case Authentication::basic: return TransportCredentials::Scheme::basic;
+    case Authentication::digest: return TransportCredentials::Scheme::digest;
+    case Authentication::automatic: break;
+    }
+    return TransportCredentials::Scheme::automatic;
+}
+
+const std::shared_ptr<const std::string>& propfindBody() {
+    static const auto body = std::make_shared<const std::string>(
+        "<?xml version=\"1.0\" encoding=\"utf-8\"?>\n<propfind xmlns=\"DAV:\"><prop><resourcetype/><getlastmodified/>"
+        "<getcontentlength/><getetag/></prop></propfind>");
+    return body;
+}
+
+} // namespace
+
+bool announcesDav1(const HttpResponse& answer) {
+    for (const auto& [name, value] : answer.headers) {
+        if (name != "dav") continue;
+        size_t at = 0;
+        while (at <= value.size()) {
+            const size_t comma = std::min(value.find(',', at), value.size());
+            const size_t first = value.find_first_not_of(" \t", at);
+            if (first < comma && value[first] == '1' &&
+                value.find_first_not_of(" \t", first + 1) >= comma)
+                return true;
+            at = comma + 1;
+        }
+    }
+    return false;
+}
+
+std::unique_ptr<CurlTransport> makeAccountTransport(const CXDAVAccount& account) {
+    CurlTransportOptions options;
+    options.caFile = account.caFile;
+    options.userAgent = CXDAVManager::ostrelUserAgent();
+    return std::make_unique<CurlTransport>(std::move(options));
+}
+
+StoreSession::StoreSession(CXDAVAccount account, std::shared_ptr<HttpTransport> transport, CurlTransport* signsIn)
+    : _account(std::move(account)), _transport(std::move(transport)), _signsIn(signsIn) {}
+
+std::optional<Url> StoreSession::endpoint(const Url& name, bool securely) const {
+    return _account.endpointFor(name, securely);
+}
+
+HttpRequest StoreSession::request(std::string method, Url url) {
+    HttpRequest r;
+    r.method = std::move(method);
+    r.url = std::move(url);
+    return r;
+}
+
+HttpRequest StoreSession::propfind(Url url, int depth) {
+    HttpRequest r = request("PROPFIND", std::move(url));
+    r.headers = {{"Depth", std::to_string(depth)}, {"Content-Type", "application/xml; charset=utf-8"}};
+    r.body = propfindBody();
+    return r;
+}
+
+std::optional<std::string> StoreSession::password() {
+    std::unique_lock lock(_mutex);
+    if (!_password || _loginRefused) {
+        try {
+            _password = _account.password();
+        } catch (const CXException& e) {
+            _password.reset();
+            lock.unlock();
+            CXLog("%@", e.reason());
+            CXFileManager::failedToGetPassword();
+            return std::nullopt;
+        }
+    }
+    return _password;
+}
+
+// Hands the credentials to the transport on first need. False when there should be some and cannot be had.
+bool StoreSession::signIn() {
+    if (!_signsIn || _signedIn) return true;
+    if (_account.passwordSource.kind != PasswordSource::Kind::none) {
+        const auto secret = password();
+        if (!secret) return false;
+        _signsIn->setCredentials(TransportCredentials{_account.user.str(), *secret, _account.origins(),
+                                                      schemeOf(_account.authentication)});
+    }
+    _signedIn = true;
+    return true;
+}
+
+HttpResponse StoreSession::judged(HttpResponse answer) {
+    if (answer.status == 401) {
+        std::lock_guard guard(_mutex);
+        _loginRefused = true;
+        _loginProven = false;
+    }
+    if ((answer.status == 403 || answer.status == 404) && !isDavServer()) {
+        HttpResponse unbelieved;
+        unbelieved.error = TransportError::unreachable;
+        unbelieved.detail = "Whoever answered is not a WebDAV server.";
+        return unbelieved;
+    }
+    return answer;
+}
+
+HttpResponse StoreSession::send(HttpRequest request) {
+    if (!signIn()) {
+        HttpResponse unsent;
+        unsent.error = TransportError::refused;
+        unsent.detail = "The password of the account cannot be had.";
+        return unsent;
+    }
+    return judged(_transport->perform(std::move(request)));
+}
+
+std::vector<HttpResponse> StoreSession::sendAll(std::vector<HttpRequest> requests) {
+    if (!signIn()) {
+        HttpResponse unsent;
+        unsent.error = TransportError::refused;
+        return std::vector<HttpResponse>(requests.size(), unsent);
+    }
+    auto answers = _transport->performAll(std::move(requests));
+    for (auto& a : answers) a = judged(std::move(a));
+    return answers;
+}
+
+HttpResponse StoreSession::options() {
+    const auto base = endpoint(_account.baseLocationFor(_account.user));
+    if (!base) return {};
+    HttpRequest r = request("OPTIONS", *base);
+    r.limits = {20, 10, 1u << 20, 64u << 10};
+    HttpResponse answer = _transport->perform(std::move(r));
+    if (answer.complete() && (answer.ok() || answer.status == 403 || answer.status == 404) && announcesDav1(answer))
+        _davSeen = steadyMilliseconds();
+    else if (answer.status != 401)
+        _davSeen = 0;
+    return answer;
+}
+
+bool StoreSession::isDavServer() {
+    const auto recent = [this] {
+        const int64_t seen = _davSeen;
+        return seen != 0 && steadyMilliseconds() - seen < kBeliefMilliseconds;
+    };
+    if (recent()) return true;
+    options();
+    return recent();
+}
+
+CXDAVError StoreSession::errorFrom(const HttpResponse& answer, const char* asked) const {
+    const std::string where = _account.origins().empty() ? "the store" : _account.origins().front();
+    if (answer.error == TransportError::timedOut)
+        return {kCXDAVErrorTimedOut, where + " did not answer in time. It is tried again later."};
+    if (answer.error == TransportError::tls)
+        return {kCXDAVErrorSecureConnection, "No secure connection to " + where + ": " + answer.detail +
+                                                 ". Check the account's authority file and host name."};
+    if (!answer.complete())
+        return {kCXDAVErrorCannotConnect, where + " cannot be reached: " + answer.detail + ". It is tried again later."};
+    if (answer.status == 401)
+        return {kCXDAVErrorAuthentication, where + " refused the user name or the password of \"" +
+                                               _account.user.str() + "\". Correct the account."};
+    return {kCXDAVErrorBadServerResponse, where + " answered " + asked + " with " + std::to_string(answer.status) +
+                                              " and is no WebDAV server. Check the account's endpoint."};
+}
+
+bool StoreSession::canReach(CXDAVError& error) {
+    error = {};
+    bool needsLoginProof;
+    {
+        std::lock_guard guard(_mutex);
+        if (_loginRefused) _signedIn = false; // the password may have been corrected meanwhile
+        needsLoginProof = !_loginProven;
+    }
+    if (!signIn()) {
+        error = {kCXDAVErrorNoPassword, "The password of the account cannot be had."};
+        return false;
+    }
+    const HttpResponse answer = options();
+    if (!answer.complete() || answer.status == 401 || _davSeen == 0) {
+        error = errorFrom(answer, "OPTIONS");
+        std::lock_guard guard(_mutex);
+        _loginRefused = _loginRefused || answer.status == 401;
+        return false;
+    }
+    // Servers may answer OPTIONS without looking at the login, so the login is proven once by a request that needs it.
+    if (needsLoginProof) {
+        const HttpResponse proof =
+            _transport->perform(propfind(*endpoint(_account.baseLocationFor(_account.user)), 0));
+        if (!proof.complete() || proof.status == 401) {
+            error = errorFrom(proof, "PROPFIND");
+            std::lock_guard guard(_mutex);
+            _loginRefused = _loginRefused || proof.status == 401;
+            return false;
+        }
+    }
+    std::lock_guard guard(_mutex);
+    _loginProven = true;
+    _loginRefused = false;
+    return true;
+}
+
+} // namespace rolvane

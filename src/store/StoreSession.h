@@ -1,0 +1,68 @@
+#pragma once
+
+#include "store/Account.h"
+#include "store/CXDAVManager.h"
+#include "store/HttpTransport.h"
+
+#include <atomic>
+#include <chrono>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace rolvane {
+
+class CurlTransport;
+
+// Sends WebDAV requests for one account and judges the answers: who may be believed, and what the login is worth.
+// Any thread.
+class StoreSession {
+public:
+    StoreSession(CXDAVAccount account, std::shared_ptr<HttpTransport> transport, CurlTransport* signsIn);
+
+    const CXDAVAccount& account() const { return _account; }
+    HttpTransport& transport() { return *_transport; }
+
+    // The endpoint of a name, or nothing.
+    std::optional<Url> endpoint(const Url& name, bool securely = false) const;
+
+    // Sends the request. A 403 or 404 is believed only from a WebDAV server: otherwise the answer is an `unreachable`.
+    HttpResponse send(HttpRequest request);
+    std::vector<HttpResponse> sendAll(std::vector<HttpRequest> requests);
+
+    // Whether the store can be used, see CXDAVManager::canReachOstrelError.
+    bool canReach(CXDAVError& error);
+    // The password; absent, and the failed-password handler called, when it cannot be had.
+    std::optional<std::string> password();
+
+    static HttpRequest request(std::string method, Url url);
+    static HttpRequest propfind(Url url, int depth);
+
+private:
+    bool signIn();
+    HttpResponse judged(HttpResponse answer);
+    bool isDavServer();
+    HttpResponse options();
+    CXDAVError errorFrom(const HttpResponse& answer, const char* asked) const;
+
+    const CXDAVAccount _account;
+    const std::shared_ptr<HttpTransport> _transport;
+    CurlTransport* const _signsIn; // gets the credentials; none when the transport has its own
+
+    std::mutex _mutex; // guards the following
+    std::optional<std::string> _password;
+    bool _loginRefused = false;  // a 401 was seen: ask for the password anew
+    bool _loginProven = false;   // a request that needs a login has succeeded
+    std::atomic<bool> _signedIn{false};
+    std::atomic<int64_t> _davSeen{0}; // steady milliseconds when the server last proved to be a WebDAV server; 0: never
+};
+
+// "DAV: 1, 2" -> true (RFC 4918 section 10.1)
+bool announcesDav1(const HttpResponse& answer);
+
+// The transport for an account over libcurl, without credentials yet.
+std::unique_ptr<CurlTransport> makeAccountTransport(const CXDAVAccount& account);
+
+} // namespace rolvane

@@ -1,0 +1,60 @@
+#pragma once
+
+#include "foundation/Date.h"
+#include "foundation/StrongString.h"
+
+#include <cstdint>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <unordered_map>
+
+namespace rolvane {
+
+// What a server says about the version of a file: in a listing, or with an answer.
+struct FileVersion {
+    EntityTag etag;                   // empty when the server gives none
+    std::optional<Date> lastModified; // to the second
+    uint64_t size = 0;
+};
+
+// Remembers, per URL, the version of each remote file that this client last read or wrote. A cache: a forgotten version
+// costs a read. Bounded: past `capacity` URLs it forgets some. Weak and strong forms of one entity tag are one version.
+// Any thread.
+//   file = "RVM1" seed:u64 (urlHash:u64 kind:u64 value:u64)*   little endian as the machine has it
+class VersionMemory {
+public:
+    // `path` empty: in memory only. A damaged or missing file is an empty memory.
+    explicit VersionMemory(std::string path = {}, size_t capacity = 400000);
+
+    void read(std::string_view url, const FileVersion& version);
+    // After a write: servers that give no entity tag then are matched by size and their own date, give or take a second.
+    void wrote(std::string_view url, const EntityTag& etag, std::optional<Date> serverDate, uint64_t size);
+    void forget(std::string_view url);
+    // True when the version in a listing is the one remembered.
+    bool knows(std::string_view url, const FileVersion& version);
+
+    void save(); // nothing when unchanged; a failure is logged
+    size_t count() const;
+
+private:
+    enum class Kind : uint64_t { tag = 1, dated = 2, written = 3 };
+    struct Entry {
+        Kind kind;
+        uint64_t value;
+    };
+    uint64_t hash(std::string_view text) const;
+    uint64_t tagHash(const EntityTag& tag) const;
+    void put(std::string_view url, Entry entry);
+    void load();
+
+    const std::string _path;
+    const size_t _capacity;
+    mutable std::mutex _mutex; // guards the following
+    uint64_t _seed;
+    std::unordered_map<uint64_t, Entry> _entries;
+    bool _changed = false;
+};
+
+} // namespace rolvane
