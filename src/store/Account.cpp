@@ -241,11 +241,11 @@ std::optional<Url> CXDAVAccount::nameFor(std::string_view href) const {
     for (const std::string* text : {&endpoint, &secureEndpoint}) {
         const auto e = parsedTemplate(*text);
         if (!e || (!origin.empty() && origin != originOf(*e))) continue;
-        const size_t user = e->before.size(), rest = user + 1 + e->after.size();
+        const size_t userAt = e->before.size(), rest = userAt + 1 + e->after.size();
         if (segments->size() < rest || !std::equal(e->before.begin(), e->before.end(), segments->begin()) ||
-            !std::equal(e->after.begin(), e->after.end(), segments->begin() + static_cast<long>(user) + 1))
+            !std::equal(e->after.begin(), e->after.end(), segments->begin() + static_cast<long>(userAt) + 1))
             continue;
-        std::string name = baseLocationFor(UserName((*segments)[user])).absoluteString();
+        std::string name = baseLocationFor(UserName((*segments)[userAt])).absoluteString();
         appendSegments(name, {segments->begin() + static_cast<long>(rest), segments->end()});
         return Url::parse(name);
     }

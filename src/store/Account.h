@@ -35,7 +35,9 @@ enum class Authentication { automatic, basic, digest };
 class CXDAVAccount {
 public:
     UserName user;
-@@    std::string nameHost; // "host[:port]"; empty: the endpoint's host, with its port when it has one
+    std::string endpoint;       // template, see above; https, or http when plainLoopback
+    std::string secureEndpoint; // https template; needed when `endpoint` is plain http: secure requests go there
+    std::string nameHost; // "host[:port]"; empty: the endpoint's host, with its port when it has one
     PasswordSource passwordSource;
     Authentication authentication = Authentication::automatic;
     std::string caFile;         // PEM file of a private authority; empty: the system's authorities

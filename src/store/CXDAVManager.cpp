@@ -4,7 +4,7 @@
 #include "foundation/Log.h"
 #include "foundation/Paths.h"
 #include "store/CXDAVManagerImpl.h"
-#include "store/StoreConfiguration.h"
+#include "store/ConfigurationValues.h"
 
 namespace rolvane {
 
@@ -92,10 +92,10 @@ Url CXDAVManager::ostrelBaseLocationForOstrelUser(const UserName& user) {
     return manager->account().baseLocationFor(user);
 }
 
-void CXDAVManager::updateConfigDataIfNeeded() { StoreConfiguration::shared().updateIfNeeded(); }
+void CXDAVManager::updateConfigDataIfNeeded() { ConfigurationValues::shared().updateIfNeeded(); }
 
 Value CXDAVManager::configValueForKey(const std::string& key, Value defaultValue) {
-    return StoreConfiguration::shared().valueForKey(key, std::move(defaultValue));
+    return ConfigurationValues::shared().valueForKey(key, std::move(defaultValue));
 }
 
 // ---- one client

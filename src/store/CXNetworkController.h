@@ -8,7 +8,7 @@ namespace rolvane {
 class NotificationCenter;
 class RunLoop;
 
-// Posted in-process when addresses or links changed, at most once in a second and a half second after the last change.
+// Posted in-process when addresses or links changed, half a second after the last change.
 inline constexpr const char* kCXNetworkConfigurationDidChangeNotification =
     "kCXNetworkConfigurationDidChangeNotification";
 

@@ -8,6 +8,7 @@
 #include <mutex>
 #include <set>
 #include <signal.h>
+#include <strings.h>
 #include <sys/epoll.h>
 #include <sys/eventfd.h>
 #include <thread>

@@ -6,9 +6,7 @@
 #include "store/CXDAVManagerImpl.h"
 
 #include <algorithm>
-#include <cerrno>
 #include <cstdio>
-#include <signal.h>
 #include <unistd.h>
 
 namespace rolvane {
@@ -32,12 +30,29 @@ std::string LockLedger::pathFor(const std::string& url) const {
     return _directory + name;
 }
 
-// The file: process id, URL and token, a line each.
+namespace {
+
+// When the process was started, in the kernel's ticks (field 22 of its stat file); "" when there is no such process.
+// Together with the id it names a process for good.
+std::string startOfProcess(const std::string& pid) {
+    try {
+        const std::string text = readFile("/proc/" + pid + "/stat", 65536);
+        size_t at = text.rfind(')');
+        for (int field = 2; at != std::string::npos && field < 22; ++field) at = text.find(' ', at + 1);
+        return at == std::string::npos ? "" : text.substr(at + 1, text.find(' ', at + 1) - at - 1);
+    } catch (const CXException&) {
+        return {};
+    }
+}
+
+} // namespace
+
+// The file: process id and start, URL and token, a line each.
 void LockLedger::note(const std::string& url, const LockToken& token) {
     if (_directory.empty()) return;
     try {
         CXPathUtils_MakeCompletePath(_directory, 0700);
-        writeFileDurably(pathFor(url), std::to_string(getpid()) + "\n" + url + "\n" + token.str() + "\n");
+        writeFileDurably(pathFor(url), std::to_string(getpid()) + " " + startOfProcess("self") + "\n" + url + "\n" + token.str() + "\n");
     } catch (const CXException& e) {
         CXDLog("A lock token is not written down: %@", e.reason());
     }
@@ -55,8 +70,9 @@ std::optional<LockToken> LockLedger::orphan(const std::string& url) const {
         const std::string text = readFile(path, 16384);
         const size_t first = text.find('\n'), second = text.find('\n', first + 1), third = text.find('\n', second + 1);
         if (third == std::string::npos || text.substr(first + 1, second - first - 1) != url) return std::nullopt;
-        const int pid = atoi(text.c_str());
-        if (pid > 0 && pid != getpid() && (kill(pid, 0) == 0 || errno == EPERM)) return std::nullopt;
+        const size_t space = text.find(' ');
+        if (space == std::string::npos || space > first) return std::nullopt;
+        if (startOfProcess(text.substr(0, space)) == text.substr(space + 1, first - space - 1)) return std::nullopt;
         return LockToken(text.substr(second + 1, third - second - 1));
     } catch (const CXException&) {
         return std::nullopt;

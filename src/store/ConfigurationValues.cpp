@@ -1,4 +1,4 @@
-#include "store/StoreConfiguration.h"
+#include "store/ConfigurationValues.h"
 
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
@@ -10,12 +10,12 @@
 
 namespace rolvane {
 
-StoreConfiguration& StoreConfiguration::shared() {
-    static StoreConfiguration configuration;
+ConfigurationValues& ConfigurationValues::shared() {
+    static ConfigurationValues configuration;
     return configuration;
 }
 
-void StoreConfiguration::updateIfNeeded() {
+void ConfigurationValues::updateIfNeeded() {
     std::lock_guard guard(_mutex);
     try {
         const std::string path = configDirectory() + "/config.plist";
@@ -34,7 +34,7 @@ void StoreConfiguration::updateIfNeeded() {
     }
 }
 
-Value StoreConfiguration::valueForKey(const std::string& key, Value defaultValue) {
+Value ConfigurationValues::valueForKey(const std::string& key, Value defaultValue) {
     for (const char* domain : {kDaemonDomain, kApplicationDomain}) {
         try {
             if (Value v = Preferences::shared().get(domain, key)) return v;

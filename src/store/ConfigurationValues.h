@@ -9,9 +9,9 @@ namespace rolvane {
 
 // Configuration values: the daemon's preferences domain, then the application's, then configDirectory()/config.plist
 // (a dictionary). A file that cannot be read counts as empty and is logged. Any thread.
-class StoreConfiguration {
+class ConfigurationValues {
 public:
-    static StoreConfiguration& shared();
+    static ConfigurationValues& shared();
     Value valueForKey(const std::string& key, Value defaultValue);
     void updateIfNeeded(); // reads the file anew when its path, time or size has changed
 
