@@ -57,7 +57,9 @@ std::optional<Endpoint> parsedTemplate(const std::string& text) {
     return Url::parse(e.scheme + "://" + e.authority + "/") ? std::optional(e) : std::nullopt;
 }
 
-std::string originOf(const Endpoint& e) { return Url(e.scheme + "://" + e.authority + "/").origin(); }
+std::string originOf(const Endpoint& e) {
+    return Url(e.scheme + "://" + e.authority + "/").origin();
+}
 
 void appendSegments(std::string& text, const std::vector<std::string>& segments) {
     for (const std::string& s : segments) text += "/" + Url::percentEncodeComponent(s);
@@ -138,7 +140,8 @@ std::optional<std::string> CXDAVAccount::problem() const {
                "same store too.";
     if (!secureEndpoint.empty())
         if (auto p = problemWithTemplate(secureEndpoint, false)) return p;
-    if (!Url::parse("http://" + effectiveNameHost() + "/") || effectiveNameHost().find_first_of("/@?# ") != std::string::npos)
+    if (!Url::parse("http://" + effectiveNameHost() + "/") ||
+        effectiveNameHost().find_first_of("/@?# ") != std::string::npos)
         return "\"" + nameHost + "\" is not a host name with an optional port.";
     if (passwordSource.kind != PasswordSource::Kind::none && passwordSource.value.empty())
         return "The account does not say which " + nameIn(kPasswordKinds, passwordSource.kind) + " gives the password.";
@@ -147,7 +150,9 @@ std::optional<std::string> CXDAVAccount::problem() const {
     return std::nullopt;
 }
 
-std::string CXDAVAccount::defaultPath() { return configDirectory() + "/account.plist"; }
+std::string CXDAVAccount::defaultPath() {
+    return configDirectory() + "/account.plist";
+}
 
 Dictionary CXDAVAccount::dictionary() const {
     return {{"user", user.str()},
@@ -192,7 +197,9 @@ void CXDAVAccount::save(const std::string& path) const {
     writeFileDurably(path.empty() ? defaultPath() : path, PropertyList::toXML(dictionary()), 0600);
 }
 
-std::string CXDAVAccount::password() const { return readPassword(passwordSource); }
+std::string CXDAVAccount::password() const {
+    return readPassword(passwordSource);
+}
 
 std::string CXDAVAccount::effectiveNameHost() const {
     if (!nameHost.empty()) return nameHost;

@@ -37,7 +37,7 @@ public:
     UserName user;
     std::string endpoint;       // template, see above; https, or http when plainLoopback
     std::string secureEndpoint; // https template; needed when `endpoint` is plain http: secure requests go there
-    std::string nameHost; // "host[:port]"; empty: the endpoint's host, with its port when it has one
+    std::string nameHost;       // "host[:port]"; empty: the endpoint's host, with its port when it has one
     PasswordSource passwordSource;
     Authentication authentication = Authentication::automatic;
     std::string caFile;         // PEM file of a private authority; empty: the system's authorities
@@ -64,12 +64,12 @@ public:
     // The endpoints' origins (see Url::origin): the only places that ever get the password.
     std::vector<std::string> origins() const;
 
-    // Name -> where its bytes are, https when `securely`. Nothing when the URL is not below a remote location of this account's name host, or
-    // when a segment of it is "." or ".." or holds a control character. The scheme of the name (http or https) is not
-    // looked at.
+    // Name -> where its bytes are, https when `securely`. Nothing when the URL is not below a remote location of this
+    // account's name host, or when a segment of it is "." or ".." or holds a control character. The scheme of the name
+    // (http or https) is not looked at.
     std::optional<Url> endpointFor(const Url& name, bool securely) const;
-    // An href of an answer (absolute URL or absolute path) -> the name. Nothing when it leaves the endpoints' origins or
-    // trees, or is hostile as above. A trailing slash is dropped.
+    // An href of an answer (absolute URL or absolute path) -> the name. Nothing when it leaves the endpoints' origins
+    // or trees, or is hostile as above. A trailing slash is dropped.
     std::optional<Url> nameFor(std::string_view href) const;
 
     friend bool operator==(const CXDAVAccount&, const CXDAVAccount&) = default;

@@ -54,10 +54,16 @@ CXDAVManager::CXDAVManager(CXDAVAccount account, VersionsFile versions) {
 CXDAVManager::CXDAVManager(CXDAVAccount account, std::shared_ptr<HttpTransport> transport)
     : _impl(std::make_shared<Impl>(std::move(account), std::move(transport), nullptr, std::string())) {}
 
-CXDAVManager::~CXDAVManager() { _impl->versions.save(); }
+CXDAVManager::~CXDAVManager() {
+    _impl->versions.save();
+}
 
-const CXDAVAccount& CXDAVManager::account() const { return _impl->session.account(); }
-HttpTransport& CXDAVManager::transport() { return _impl->session.transport(); }
+const CXDAVAccount& CXDAVManager::account() const {
+    return _impl->session.account();
+}
+HttpTransport& CXDAVManager::transport() {
+    return _impl->session.transport();
+}
 
 // ---- the process's own
 
@@ -68,23 +74,33 @@ static std::shared_ptr<CXDAVManager> shared() {
     return sharedManager;
 }
 
-CXDAVManager& CXDAVManager::defaultManager() { return *shared(); }
+CXDAVManager& CXDAVManager::defaultManager() {
+    return *shared();
+}
 
 void CXDAVManager::setDefaultManager(std::shared_ptr<CXDAVManager> manager) {
     std::lock_guard guard(sharedMutex);
     std::swap(sharedManager, manager);
 }
 
-std::string CXDAVManager::vaultraUser() { return shared()->account().user.str(); }
-std::string CXDAVManager::password() { return shared()->_impl->session.password().value_or(""); }
-std::string CXDAVManager::ostrelUserAgent() { return "Rolvane/" ROLVANE_VERSION; }
+std::string CXDAVManager::vaultraUser() {
+    return shared()->account().user.str();
+}
+std::string CXDAVManager::password() {
+    return shared()->_impl->session.password().value_or("");
+}
+std::string CXDAVManager::ostrelUserAgent() {
+    return "Rolvane/" ROLVANE_VERSION;
+}
 
 std::string CXDAVManager::vaultraAddress() {
     const auto origins = shared()->account().origins();
     return origins.empty() ? "" : Url(origins.front() + "/").host();
 }
 
-bool CXDAVManager::canReachOstrelError(CXDAVError& error) { return shared()->canReach(error); }
+bool CXDAVManager::canReachOstrelError(CXDAVError& error) {
+    return shared()->canReach(error);
+}
 
 Url CXDAVManager::ostrelBaseLocationForOstrelUser(const UserName& user) {
     const auto manager = shared();
@@ -92,7 +108,9 @@ Url CXDAVManager::ostrelBaseLocationForOstrelUser(const UserName& user) {
     return manager->account().baseLocationFor(user);
 }
 
-void CXDAVManager::updateConfigDataIfNeeded() { ConfigurationValues::shared().updateIfNeeded(); }
+void CXDAVManager::updateConfigDataIfNeeded() {
+    ConfigurationValues::shared().updateIfNeeded();
+}
 
 Value CXDAVManager::configValueForKey(const std::string& key, Value defaultValue) {
     return ConfigurationValues::shared().valueForKey(key, std::move(defaultValue));
@@ -121,7 +139,9 @@ bool CXDAVManager::write(const std::string& text, const Url& url, bool securely,
     return StoreFiles::succeeded(status);
 }
 
-std::optional<Date> CXDAVManager::modDateForURL(const Url& url) { return _impl->files.modificationDate(url); }
+std::optional<Date> CXDAVManager::modDateForURL(const Url& url) {
+    return _impl->files.modificationDate(url);
+}
 
 std::optional<Dictionary> CXDAVManager::dictionaryAtURL(const Url& url, bool securely, int* code) {
     auto reading = _impl->files.read(url, securely);
@@ -139,8 +159,12 @@ bool CXDAVManager::removeFileAtURL(const Url& url, int* code) {
     return StoreFiles::succeeded(status) || status == 404;
 }
 
-bool CXDAVManager::removeDirectoryAndContentsAtURL(const Url& url) { return removeFileAtURL(url, nullptr); }
-bool CXDAVManager::createDirectoryAtAURL(const Url& url) { return _impl->files.makeCollection(url); }
+bool CXDAVManager::removeDirectoryAndContentsAtURL(const Url& url) {
+    return removeFileAtURL(url, nullptr);
+}
+bool CXDAVManager::createDirectoryAtAURL(const Url& url) {
+    return _impl->files.makeCollection(url);
+}
 
 std::optional<FileListing> CXDAVManager::infoForFilesInContainer(const Url& url) {
     return StoreListing(_impl->session, _impl->versions).list(url);
@@ -150,14 +174,20 @@ bool CXDAVManager::sanityCheckPublishStructureCreate(bool create) {
     return !account().user.empty() && _impl->structure.check(create);
 }
 
-bool CXDAVManager::ACLsAtURL(const Url&, std::vector<std::string>&, std::vector<std::string>&) { return false; }
+bool CXDAVManager::ACLsAtURL(const Url&, std::vector<std::string>&, std::vector<std::string>&) {
+    return false;
+}
 
 bool CXDAVManager::setACLsWithReadPrincipals(const std::vector<std::string>&, const std::vector<std::string>&,
                                              const Url&) {
     return false;
 }
 
-void CXDAVManager::saveVersionMemory() { _impl->versions.save(); }
-void CXDAVManager::abortAll() { _impl->session.transport().abortAll(); }
+void CXDAVManager::saveVersionMemory() {
+    _impl->versions.save();
+}
+void CXDAVManager::abortAll() {
+    _impl->session.transport().abortAll();
+}
 
 } // namespace rolvane

@@ -12,7 +12,8 @@ namespace rolvane {
 
 // What a client is made of, in the order in which its parts need one another.
 struct CXDAVManager::Impl {
-    Impl(CXDAVAccount account, std::shared_ptr<HttpTransport> transport, CurlTransport* signsIn, std::string versionsPath);
+    Impl(CXDAVAccount account, std::shared_ptr<HttpTransport> transport, CurlTransport* signsIn,
+         std::string versionsPath);
 
     LockTokens tokens;
     VersionMemory versions;

@@ -97,7 +97,8 @@ std::optional<FileListing> CXFileManager::infoForFilesInContainer(const Url& url
         if (info.displayName == CXDAVManager::kStateName) continue;
         info.isCollection = S_ISDIR(st.st_mode);
         info.size = static_cast<uint64_t>(st.st_size);
-        info.modificationdate = Date(static_cast<double>(st.st_mtim.tv_sec) + static_cast<double>(st.st_mtim.tv_nsec) / 1e9);
+        info.modificationdate =
+            Date(static_cast<double>(st.st_mtim.tv_sec) + static_cast<double>(st.st_mtim.tv_nsec) / 1e9);
         out[entry.path().string()] = std::move(info);
     }
     return error ? std::nullopt : std::optional(std::move(out));

@@ -129,7 +129,11 @@ void CXNetworkController::startMonitoring(RunLoop& loop, NotificationCenter& cen
     });
 }
 
-void CXNetworkController::stopMonitoring() { _impl->stop(); }
-void CXNetworkController::configurationDidChange() { _impl->changed(); }
+void CXNetworkController::stopMonitoring() {
+    _impl->stop();
+}
+void CXNetworkController::configurationDidChange() {
+    _impl->changed();
+}
 
 } // namespace rolvane

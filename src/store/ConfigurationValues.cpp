@@ -19,12 +19,12 @@ void ConfigurationValues::updateIfNeeded() {
     std::lock_guard guard(_mutex);
     try {
         const std::string path = configDirectory() + "/config.plist";
-        struct stat st{};
+        struct stat st {};
         const bool present = stat(path.c_str(), &st) == 0;
-        const std::string stamp = path + (present ? "|" + std::to_string(st.st_mtim.tv_sec) + "." +
-                                                        std::to_string(st.st_mtim.tv_nsec) + "|" +
-                                                        std::to_string(st.st_size) + "|" + std::to_string(st.st_ino)
-                                                  : "");
+        const std::string stamp =
+            path + (present ? "|" + std::to_string(st.st_mtim.tv_sec) + "." + std::to_string(st.st_mtim.tv_nsec) + "|" +
+                                  std::to_string(st.st_size) + "|" + std::to_string(st.st_ino)
+                            : "");
         if (stamp == _stamp) return;
         _stamp = stamp;
         _file = Dictionary();

@@ -11,13 +11,15 @@ namespace rolvane {
 
 void HttpJob::forgetAnswer() {
     response = {};
+    headerDone = false;
     headerBytes = bodyBytes = 0;
     verdict = TransportError::none;
     verdictDetail.clear();
 }
 
 bool HttpJob::mayCarryCredentials() const {
-    return credentials && std::find(credentials->origins.begin(), credentials->origins.end(), origin) != credentials->origins.end();
+    return credentials &&
+           std::find(credentials->origins.begin(), credentials->origins.end(), origin) != credentials->origins.end();
 }
 
 namespace {
@@ -188,19 +190,27 @@ bool CurlSlot::takeHeaderLine(std::string_view line) {
     job.headerBytes += line.size();
     if (job.headerBytes > job.request.limits.maxHeaderBytes) {
         job.verdict = TransportError::tooLarge;
-        job.verdictDetail = "The answer's header passed " + std::to_string(job.request.limits.maxHeaderBytes) + " bytes.";
+        job.verdictDetail =
+            "The answer's header passed " + std::to_string(job.request.limits.maxHeaderBytes) + " bytes.";
         return false;
     }
     if (line.starts_with("HTTP/")) { // a new answer: what came before was an interim one or a challenge
         job.response.headers.clear();
         job.response.body.clear();
+        job.headerDone = false;
         const size_t space = line.find(' ');
-        job.response.status = space == std::string_view::npos ? 0 : atoi(std::string(line.substr(space + 1, 3)).c_str());
+        job.response.status =
+            space == std::string_view::npos ? 0 : atoi(std::string(line.substr(space + 1, 3)).c_str());
+        return true;
+    }
+    if (trimmed(line).empty()) {
+        job.headerDone = job.response.status >= 200;
         return true;
     }
     const size_t colon = line.find(':');
     if (colon == std::string_view::npos) return true;
-    job.response.headers.emplace_back(lowered(trimmed(line.substr(0, colon))), std::string(trimmed(line.substr(colon + 1))));
+    job.response.headers.emplace_back(lowered(trimmed(line.substr(0, colon))),
+                                      std::string(trimmed(line.substr(colon + 1))));
     return true;
 }
 

@@ -23,6 +23,7 @@ struct HttpJob {
     int repetitions = 0;
 
     HttpResponse response;
+    bool headerDone = false; // of the final answer
     size_t headerBytes = 0, bodyBytes = 0;
     TransportError verdict = TransportError::none; // why the transfer was ended from our side
     std::string verdictDetail;

@@ -22,7 +22,9 @@ namespace {
 using namespace std::chrono;
 using Steady = steady_clock;
 
-steady_clock::duration inSeconds(double s) { return duration_cast<steady_clock::duration>(duration<double>(s)); }
+steady_clock::duration inSeconds(double s) {
+    return duration_cast<steady_clock::duration>(duration<double>(s));
+}
 
 // The one place where libcurl's codes become ours.
 TransportError translated(CURLcode code) {
@@ -128,7 +130,7 @@ struct CurlTransport::Impl {
     std::unordered_set<CurlSlot*> active;
     std::set<std::string> digestOrigins;
     std::set<std::string> http2Origins;
-    SteadyTime notBefore{};                 // Retry-After
+    SteadyTime notBefore{}; // Retry-After
     std::optional<SteadyTime> curlTimer;
     SteadyTime nextCheck{};
     uint64_t seenEpoch = 0;
@@ -305,7 +307,9 @@ size_t CurlTransport::Impl::admissionLimit() const {
     return static_cast<size_t>(http2Origins.empty() ? options.maxConnections : options.maxStreams);
 }
 
-bool CurlTransport::Impl::heldBack(SteadyTime now) { return notBefore > now; }
+bool CurlTransport::Impl::heldBack(SteadyTime now) {
+    return notBefore > now;
+}
 
 void CurlTransport::Impl::admit() {
     if (pending.empty() || heldBack(Steady::now())) return;
@@ -362,7 +366,9 @@ void CurlTransport::Impl::finished(CurlSlot& slot, CURLcode code) {
         http2Origins.insert(job->origin);
     else if (code == CURLE_OK && !http2Origins.empty())
         http2Origins.erase(job->origin);
-    if (code != CURLE_OK) {
+    // A server that refuses an upload before it has read it resets the stream behind its answer (RFC 9113 section 8.1).
+    const bool refusedEarly = code == CURLE_HTTP2_STREAM && job->headerDone && job->response.status >= 400;
+    if (code != CURLE_OK && !refusedEarly) {
         const TransportError error = job->verdict != TransportError::none ? job->verdict : translated(code);
         const std::string detail = job->verdict != TransportError::none ? job->verdictDetail : curl_easy_strerror(code);
         return fail(std::move(job), error, detail);
@@ -377,8 +383,8 @@ bool CurlTransport::Impl::sendAgain(std::unique_ptr<HttpJob>& job) {
     const int status = job->response.status;
     if (status == 401) {
         ++challenged;
-        const bool automatic = job->mayCarryCredentials() &&
-                               job->credentials->scheme == TransportCredentials::Scheme::automatic;
+        const bool automatic =
+            job->mayCarryCredentials() && job->credentials->scheme == TransportCredentials::Scheme::automatic;
         if (!automatic || job->repetitions > 0 || !wantsDigest(job->response)) return false;
         digestOrigins.insert(job->origin);
     } else if (status == 503 || status == 429) {
@@ -453,7 +459,9 @@ HttpResponse CurlTransport::perform(HttpRequest request) {
     return std::move(*waiting->answer);
 }
 
-void CurlTransport::start(HttpRequest request, Completion done) { _impl->enqueue(std::move(request), std::move(done)); }
+void CurlTransport::start(HttpRequest request, Completion done) {
+    _impl->enqueue(std::move(request), std::move(done));
+}
 
 void CurlTransport::abortAll() {
     _impl->aborted = true;
@@ -461,7 +469,9 @@ void CurlTransport::abortAll() {
     _impl->wake();
 }
 
-void CurlTransport::resume() { _impl->aborted = false; }
+void CurlTransport::resume() {
+    _impl->aborted = false;
+}
 
 void CurlTransport::setCredentials(std::optional<TransportCredentials> credentials) {
     auto fresh = credentials ? std::make_shared<const TransportCredentials>(std::move(*credentials)) : nullptr;

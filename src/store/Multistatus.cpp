@@ -109,7 +109,9 @@ struct MultistatusReader::Impl : XmlSax {
 MultistatusReader::MultistatusReader(MultistatusLimits limits) : _impl(std::make_unique<Impl>(limits)) {}
 MultistatusReader::~MultistatusReader() = default;
 
-bool MultistatusReader::feed(std::string_view bytes) { return _impl->feed(bytes); }
+bool MultistatusReader::feed(std::string_view bytes) {
+    return _impl->feed(bytes);
+}
 
 std::optional<std::vector<MultistatusEntry>> MultistatusReader::finish() {
     if (!_impl->finish() || !_impl->rootSeen) return std::nullopt;

@@ -47,7 +47,7 @@ private:
 
 // What a LOCK answer grants (RFC 4918 section 9.10): the active lock's token and timeout.
 struct LockGrant {
-    LockToken token;                     // empty when the body names none
+    LockToken token;                      // empty when the body names none
     std::optional<double> timeoutSeconds; // nothing: infinite or not said
 };
 // Nothing when the text is not one well-formed document. At most 1 MiB is looked at.

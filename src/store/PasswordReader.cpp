@@ -22,7 +22,9 @@ namespace {
 constexpr size_t kMaxBytes = 4096;
 constexpr int kCommandSeconds = 10;
 
-[[noreturn]] void fail(const std::string& reason) { throw CXException(kCXNetworkException, reason); }
+[[noreturn]] void fail(const std::string& reason) {
+    throw CXException(kCXNetworkException, reason);
+}
 
 struct Descriptor {
     int fd = -1;
@@ -31,7 +33,9 @@ struct Descriptor {
     }
 };
 
-std::string firstLine(const std::string& text) { return text.substr(0, text.find_first_of("\r\n")); }
+std::string firstLine(const std::string& text) {
+    return text.substr(0, text.find_first_of("\r\n"));
+}
 
 std::string fromFile(const std::string& path, bool checkMode) {
     Descriptor file{open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY)};

@@ -87,7 +87,8 @@ bool PublishStructure::makeTree() {
     // The folders above belong to whoever runs the store; those that are missing are made, from the top.
     const Url bytes = *_session.endpoint(tree);
     std::vector<Url> above;
-    for (Url u = bytes.cxURLByDeletingLastComponent(); !u.cxLastComponent().empty(); u = u.cxURLByDeletingLastComponent())
+    for (Url u = bytes.cxURLByDeletingLastComponent(); !u.cxLastComponent().empty();
+         u = u.cxURLByDeletingLastComponent())
         above.insert(above.begin(), u);
     for (const Url& u : above) _session.send(StoreSession::request("MKCOL", u));
     return _files.makeCollection(tree);
@@ -117,7 +118,8 @@ bool PublishStructure::complete(const Missing& missing) {
     if (missing.tree && !makeTree()) return false;
     if (missing.people && !makeAll({people})) return false;
     std::vector<Url> buckets;
-    for (const int bucket : missing.buckets) buckets.push_back(people.cxURLByAppendingComponent(std::to_string(bucket)));
+    for (const int bucket : missing.buckets)
+        buckets.push_back(people.cxURLByAppendingComponent(std::to_string(bucket)));
     if (!buckets.empty() && !makeAll(buckets)) return false;
     if (missing.dateFile && !writeNew(base().cxURLByAppendingComponent("dateFile"), "why")) return false;
     if (missing.info) {

@@ -5,6 +5,9 @@
 #include "foundation/PropertyList.h"
 #include "store/Multistatus.h"
 
+#include <atomic>
+#include <map>
+
 namespace rolvane {
 
 namespace {
@@ -14,22 +17,33 @@ constexpr size_t kMaxKnownCollections = 20000;
 
 // The dictionary that a thread read last, and what its next write to the same place has to find there.
 struct ReadMark {
-    const void* reader = nullptr;
     Url name, target;
+    bool set = false;
     enum class State { unknown, absent, present } state = State::unknown;
     EntityTag etag;
 };
-thread_local ReadMark lastRead;
+thread_local std::map<uint64_t, ReadMark> lastReads; // by reader
 
-ReadMark takeMark(const void* reader, const Url& name) {
-    ReadMark mark = std::move(lastRead);
-    lastRead = {};
-    return mark.reader == reader && mark.name == name ? mark : ReadMark();
+ReadMark takeMark(uint64_t reader, const Url& name) {
+    const auto found = lastReads.find(reader);
+    if (found == lastReads.end()) return {};
+    const ReadMark mark = std::move(found->second);
+    lastReads.erase(found);
+    return mark.name == name ? mark : ReadMark();
 }
 
-bool mayBeBoth(const Url& name) { return name.encodedPath().ends_with("CXGroup"); }
+uint64_t nextReader() {
+    static std::atomic<uint64_t> last{0};
+    return ++last;
+}
 
-Url stateURL(const Url& collection) { return collection.cxURLByAppendingComponent(CXDAVManager::kStateName); }
+bool mayBeBoth(const Url& name) {
+    return name.encodedPath().ends_with("CXGroup");
+}
+
+Url stateURL(const Url& collection) {
+    return collection.cxURLByAppendingComponent(CXDAVManager::kStateName);
+}
 
 bool isHtml(const HttpResponse& answer) {
     const std::string* type = answer.header("content-type");
@@ -49,8 +63,8 @@ FileVersion versionOf(const HttpResponse& answer) {
 std::vector<std::pair<std::string, std::string>> conditions(const ReadMark& mark, const LockToken& token) {
     std::vector<std::pair<std::string, std::string>> out;
     std::string state = token.empty() ? "" : "<" + token.str() + ">";
-    if (mark.reader && mark.state == ReadMark::State::absent) out.emplace_back("If-None-Match", "*");
-    if (mark.reader && mark.state == ReadMark::State::present && !mark.etag.empty()) {
+    if (mark.set && mark.state == ReadMark::State::absent) out.emplace_back("If-None-Match", "*");
+    if (mark.set && mark.state == ReadMark::State::present && !mark.etag.empty()) {
         if (mark.etag.str().starts_with("W/"))
             state += (state.empty() ? "[" : " [") + mark.etag.str() + "]";
         else
@@ -67,7 +81,7 @@ std::string contentType(const std::string& text) {
 } // namespace
 
 StoreFiles::StoreFiles(StoreSession& session, LockTokens& tokens, VersionMemory& versions)
-    : _session(session), _tokens(tokens), _versions(versions) {}
+    : _session(session), _tokens(tokens), _versions(versions), _reader(nextReader()) {}
 
 bool StoreFiles::isReservedName(std::string_view name) {
     return name == CXDAVManager::kStateName || name.ends_with(kMakingSuffix);
@@ -152,18 +166,19 @@ StoreFiles::Fetched StoreFiles::fetchEither(const Url& url, Url& target) {
 
 // Keeps what a following write of this thread has to find.
 void StoreFiles::note(const Url& name, const Url& target, const Fetched& fetched) {
-    lastRead = {this, name, target, ReadMark::State::unknown, fetched.version.etag};
+    ReadMark mark{name, target, true, ReadMark::State::unknown, fetched.version.etag};
     if (fetched.found == Found::absent) {
-        lastRead.state = ReadMark::State::absent;
+        mark.state = ReadMark::State::absent;
         _versions.forget(name.absoluteString());
     } else if (fetched.found == Found::dictionary || fetched.found == Found::noDictionary) {
-        lastRead.state = ReadMark::State::present;
+        mark.state = ReadMark::State::present;
         _versions.read(name.absoluteString(), fetched.version);
     }
+    lastReads[_reader] = std::move(mark);
 }
 
 StoreFiles::Reading StoreFiles::read(const Url& name, bool securely) {
-    lastRead = {};
+    lastReads.erase(_reader);
     const auto url = _session.endpoint(name, securely);
     if (!url) return {};
     Url target = *url;
@@ -206,10 +221,10 @@ int StoreFiles::put(const Url& name, const Url& target, const std::shared_ptr<co
 }
 
 int StoreFiles::write(const Url& name, std::string text, bool securely, const std::function<bool()>& repair) {
-    ReadMark mark = takeMark(this, name);
+    ReadMark mark = takeMark(_reader, name);
     const auto url = _session.endpoint(name, securely);
     if (!url) return 0;
-    if (mark.reader && mark.state == ReadMark::State::unknown) return 0;
+    if (mark.set && mark.state == ReadMark::State::unknown) return 0;
     const bool both = mayBeBoth(name);
     const Url state = both ? stateURL(*url) : Url();
     const Url first = both && knownCollection(*url) ? state : *url;

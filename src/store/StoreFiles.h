@@ -62,7 +62,8 @@ private:
     StoreSession& _session;
     LockTokens& _tokens;
     VersionMemory& _versions;
-    mutable std::mutex _mutex; // guards _collections
+    const uint64_t _reader;                       // tells this object from every other one of the process
+    mutable std::mutex _mutex;                    // guards _collections
     std::unordered_set<std::string> _collections; // endpoints known to be collections; a cache
 };
 

@@ -31,9 +31,13 @@ bool isMember(const Url& name, const Url& container) {
     return name.cxURLByDeletingLastComponent().absoluteString() == container.absoluteString();
 }
 
-std::string pathOf(const Url& name) { return name.path(); }
+std::string pathOf(const Url& name) {
+    return name.path();
+}
 
-bool isBaseLocation(const Url& name) { return name.pathComponents().size() == 3; } // "/", user, "Contacts"
+bool isBaseLocation(const Url& name) {
+    return name.pathComponents().size() == 3;
+} // "/", user, "Contacts"
 
 } // namespace
 
@@ -113,8 +117,8 @@ bool StoreListing::addEntries(const Members& members, FileListing& out, std::vec
 bool StoreListing::addStates(const std::vector<Url>& groups, FileListing& out) {
     std::vector<HttpRequest> requests;
     for (const Url& group : groups)
-        requests.push_back(StoreSession::propfind(
-            _session.endpoint(group)->cxURLByAppendingComponent(CXDAVManager::kStateName), 0));
+        requests.push_back(
+            StoreSession::propfind(_session.endpoint(group)->cxURLByAppendingComponent(CXDAVManager::kStateName), 0));
     const auto answers = _session.sendAll(std::move(requests));
     for (size_t i = 0; i < answers.size(); ++i) {
         if (answers[i].status == 404) continue;

@@ -52,7 +52,8 @@ void LockLedger::note(const std::string& url, const LockToken& token) {
     if (_directory.empty()) return;
     try {
         CXPathUtils_MakeCompletePath(_directory, 0700);
-        writeFileDurably(pathFor(url), std::to_string(getpid()) + " " + startOfProcess("self") + "\n" + url + "\n" + token.str() + "\n");
+        writeFileDurably(pathFor(url), std::to_string(getpid()) + " " + startOfProcess("self") + "\n" + url + "\n" +
+                                           token.str() + "\n");
     } catch (const CXException& e) {
         CXDLog("A lock token is not written down: %@", e.reason());
     }

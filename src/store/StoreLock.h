@@ -48,8 +48,8 @@ private:
     const Url _name;
     std::optional<Url> _endpoint;
     LockLedger _ledger;
-    std::mutex _calls;          // one call at a time
-    mutable std::mutex _mutex;  // guards the following
+    std::mutex _calls;         // one call at a time
+    mutable std::mutex _mutex; // guards the following
     LockToken _token;
     Date _expires;
 };

@@ -41,9 +41,7 @@ bool announcesDav1(const HttpResponse& answer) {
         while (at <= value.size()) {
             const size_t comma = std::min(value.find(',', at), value.size());
             const size_t first = value.find_first_not_of(" \t", at);
-            if (first < comma && value[first] == '1' &&
-                value.find_first_not_of(" \t", first + 1) >= comma)
-                return true;
+            if (first < comma && value[first] == '1' && value.find_first_not_of(" \t", first + 1) >= comma) return true;
             at = comma + 1;
         }
     }
@@ -100,8 +98,8 @@ bool StoreSession::signIn() {
     if (_account.passwordSource.kind != PasswordSource::Kind::none) {
         const auto secret = password();
         if (!secret) return false;
-        _signsIn->setCredentials(TransportCredentials{_account.user.str(), *secret, _account.origins(),
-                                                      schemeOf(_account.authentication)});
+        _signsIn->setCredentials(
+            TransportCredentials{_account.user.str(), *secret, _account.origins(), schemeOf(_account.authentication)});
     }
     _signedIn = true;
     return true;
@@ -174,7 +172,8 @@ CXDAVError StoreSession::errorFrom(const HttpResponse& answer, const char* asked
         return {kCXDAVErrorSecureConnection, "No secure connection to " + where + ": " + answer.detail +
                                                  ". Check the account's authority file and host name."};
     if (!answer.complete())
-        return {kCXDAVErrorCannotConnect, where + " cannot be reached: " + answer.detail + ". It is tried again later."};
+        return {kCXDAVErrorCannotConnect,
+                where + " cannot be reached: " + answer.detail + ". It is tried again later."};
     if (answer.status == 401)
         return {kCXDAVErrorAuthentication, where + " refused the user name or the password of \"" +
                                                _account.user.str() + "\". Correct the account."};
@@ -203,8 +202,7 @@ bool StoreSession::canReach(CXDAVError& error) {
     }
     // Servers may answer OPTIONS without looking at the login, so the login is proven once by a request that needs it.
     if (needsLoginProof) {
-        const HttpResponse proof =
-            _transport->perform(propfind(*endpoint(_account.baseLocationFor(_account.user)), 0));
+        const HttpResponse proof = _transport->perform(propfind(*endpoint(_account.baseLocationFor(_account.user)), 0));
         if (!proof.complete() || proof.status == 401) {
             error = errorFrom(proof, "PROPFIND");
             std::lock_guard guard(_mutex);

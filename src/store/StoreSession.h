@@ -53,8 +53,8 @@ private:
 
     std::mutex _mutex; // guards the following
     std::optional<std::string> _password;
-    bool _loginRefused = false;  // a 401 was seen: ask for the password anew
-    bool _loginProven = false;   // a request that needs a login has succeeded
+    bool _loginRefused = false; // a 401 was seen: ask for the password anew
+    bool _loginProven = false;  // a request that needs a login has succeeded
     std::atomic<bool> _signedIn{false};
     std::atomic<int64_t> _davSeen{0}; // steady milliseconds when the server last proved to be a WebDAV server; 0: never
 };

@@ -18,9 +18,13 @@ uint64_t seconds(std::optional<Date> date) {
     return date ? static_cast<uint64_t>(static_cast<int64_t>(date->secondsSince1970())) & 0xffffffffu : 0;
 }
 
-uint64_t packed(std::optional<Date> date, uint64_t size) { return seconds(date) << 32 | (size & 0xffffffffu); }
+uint64_t packed(std::optional<Date> date, uint64_t size) {
+    return seconds(date) << 32 | (size & 0xffffffffu);
+}
 
-void append(std::string& out, uint64_t n) { out.append(reinterpret_cast<const char*>(&n), sizeof n); }
+void append(std::string& out, uint64_t n) {
+    out.append(reinterpret_cast<const char*>(&n), sizeof n);
+}
 
 } // namespace
 

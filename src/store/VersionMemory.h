@@ -29,7 +29,8 @@ public:
     explicit VersionMemory(std::string path = {}, size_t capacity = 400000);
 
     void read(std::string_view url, const FileVersion& version);
-    // After a write: servers that give no entity tag then are matched by size and their own date, give or take a second.
+    // After a write: servers that give no entity tag then are matched by size and their own date, give or take a
+    // second.
     void wrote(std::string_view url, const EntityTag& etag, std::optional<Date> serverDate, uint64_t size);
     void forget(std::string_view url);
     // True when the version in a listing is the one remembered.

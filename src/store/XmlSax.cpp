@@ -27,7 +27,9 @@ XmlSax::XmlSax(int maxDepth) : _maxDepth(static_cast<size_t>(maxDepth)) {
     xmlCtxtUseOptions(_context, XML_PARSE_NONET | XML_PARSE_NOERROR | XML_PARSE_NOWARNING);
 }
 
-XmlSax::~XmlSax() { xmlFreeParserCtxt(_context); }
+XmlSax::~XmlSax() {
+    xmlFreeParserCtxt(_context);
+}
 
 bool XmlSax::feed(std::string_view bytes) {
     while (_good && !bytes.empty()) {
