@@ -72,8 +72,8 @@ std::string explain(const std::string& path, int code, int systemError, const st
             path, detail, systemError ? ": " : "", systemError ? std::strerror(systemError) : "");
     default:
         return fmt::format(
-            "The preferences file \"{}\" cannot be used ({}{}{}). Check the disk and the file's rights, then "
-            "try again. {}",
+            "The preferences file \"{}\" cannot be used ({}{}{}). Check that there is room on its file system "
+            "and that the disk is sound, then try again. {}",
             path, detail, systemError ? ": " : "", systemError ? std::strerror(systemError) : "", kKept);
     }
 }
