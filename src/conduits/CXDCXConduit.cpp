@@ -11,8 +11,6 @@
 #include "model/PayloadKeys.h"
 #include "model/RemoteLocationMap.h"
 
-#include <unistd.h>
-
 namespace rolvane {
 namespace {
 
@@ -100,7 +98,7 @@ CXDChangeRecords CXDCXConduit::changeRecords() {
 
 void CXDCXConduit::rolvaneChanged(const Notification& notification) {
     engine().updateStateAndExitIfNeeded();
-    if (notification.userInfo[kCXSenderProcessID].integer() == getpid()) return;
+    if (notification.userInfo[kCXSenderProcessID].integer() == _world.processID) return;
     engine().checkCXShareCount();
 
     const Array inserted = notification.userInfo[kCXInsertedRecords].array();

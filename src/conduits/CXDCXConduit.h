@@ -6,6 +6,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <unistd.h>
 #include <vector>
 
 namespace rolvane {
@@ -38,6 +39,7 @@ public:
         Preferences& preferences;
         Clock& clock;
         NotificationCenter& notifications; // this process's: the framework posts other processes' saves here
+        pid_t processID = getpid();        // whose saves are this daemon's own
     };
 
     CXDCXConduit(ConduitEngine& engine, World world);

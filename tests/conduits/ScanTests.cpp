@@ -1,0 +1,273 @@
+#include "CaptureWorld.h"
+
+#include "support/WaitUntil.h"
+
+#include <sys/wait.h>
+
+using namespace rolvane;
+using namespace rolvane::test;
+
+namespace {
+
+class Scan : public CaptureWorld {
+public:
+    std::string uid(const CXRecordRef& record) { return record->sharingUniqueId().str(); }
+    // One pass in which everything that was captured is applied: every group and person is then known.
+    void pass() {
+        conduit->open();
+        conduit->changeRecords();
+        knows(kSelf, database.allGroup());
+        for (const auto& record : database.recordsMatchingSearchElement(CXGroup::searchElementForProperty(
+                 kCXModificationDateProperty, "", "", Date::distantPast(), kCXGreaterThan)))
+            knows(kSelf, std::dynamic_pointer_cast<CXGroup>(record));
+        clock.advance(1);
+        conduit->close();
+        clock.advance(1);
+    }
+    Texts scan() {
+        conduit->open();
+        return lines(conduit->changeRecords());
+    }
+};
+
+} // namespace
+
+TEST_F(Scan, TheFirstOneComparesEveryGroupAndPersonAndThenTheAllContactsGroup) {
+    publishAll();
+    const auto ada = person("Ada");
+    const auto friends = group("F", {ada});
+    save();
+    const std::string a = uid(ada), f = uid(friends);
+    const Texts group{"2 <self> - " + f + " 4",         "6 <self> " + f + " AllCXGroup 4", "1 <self> " + a + " - 4",
+                      "9 <self> " + a + " " + f + " 4", "5 <self> " + a + " " + f + " 4",  "4 <self> - " + f + " 4",
+                      "9 <self> " + a + " " + f + " 4"};
+    Texts expected = group;
+    expected.insert(expected.end(), {"1 <self> " + a + " - 4", "9 <self> " + a + " " + f + " 4"}); // the person itself
+    expected.insert(expected.end(), {"2 <self> - AllCXGroup 4", "1 <self> " + a + " - 4",
+                                     "9 <self> " + a + " " + f + " 4", "5 <self> " + a + " AllCXGroup 4"});
+    expected.insert(expected.end(), group.begin(), group.end()); // as a new subgroup of the all-contacts group
+    expected.push_back("6 <self> " + f + " AllCXGroup 4");
+    EXPECT_EQ(scan(), expected);
+    EXPECT_EQ(engine.takeCalls(), Texts{"checkCXShareCount"});
+}
+
+TEST_F(Scan, ReadsTheDistantPastWhenNoDateIsStored) {
+    conduit->open();
+    EXPECT_EQ(conduit->lastSyncDate(), Date::distantPast());
+}
+
+TEST_F(Scan, SaysNothingAboutWhatWasThereAtTheLastSync) {
+    publishAll();
+    group("F", {person("Ada")});
+    save();
+    pass();
+    EXPECT_EQ(scan(), Texts{});
+}
+
+TEST_F(Scan, AScannedPersonCountsAsUpdatedNeverAsInserted) {
+    publishAll();
+    save();
+    pass();
+    const auto ada = person("Ada");
+    save();
+    const Texts found = scan();
+    ASSERT_FALSE(found.empty());
+    EXPECT_EQ(found[0], "1 <self> " + uid(ada) + " - 4");
+    EXPECT_EQ(std::count(found.begin(), found.end(), "5 <self> " + uid(ada) + " AllCXGroup 4"), 1)
+        << "the entry comes from the comparison of the all-contacts group alone";
+}
+
+TEST_F(Scan, ComparesTheAllContactsGroupsWhateverTheDates) {
+    publishAll();
+    const auto ada = person("Ada");
+    subscribe();
+    const auto carol = subscribedPerson("Carol", "C");
+    database.allGroupForRemoteLocation(kBobsLocation)
+        ->setValue(oneLocation(kBobsLocation, kCXSubscribeLabel), kCXRemoteLocationProperty);
+    save();
+    pass();
+    knows(UserName("bob"), database.allGroupForRemoteLocation(kBobsLocation));
+    EXPECT_EQ(scan(), Texts{});
+    engine.priorState("CXDCX").remove("<self>");
+    engine.priorState("CXDCX").remove("bob");
+    EXPECT_EQ(scan(), (Texts{"2 bob - AllCXGroup 4", "1 bob C:CXPerson - 4", "5 bob C:CXPerson AllCXGroup 4",
+                             "2 <self> - AllCXGroup 4", "1 <self> " + uid(ada) + " - 4",
+                             "5 <self> " + uid(ada) + " AllCXGroup 4"}));
+}
+
+TEST_F(Scan, APersonCapturedSeveralTimesSharesOnePayload) {
+    publishAll();
+    const auto ada = person("Ada");
+    group("F", {ada});
+    group("G", {ada});
+    save();
+    conduit->open();
+    std::set<const Bytes*> payloads;
+    size_t updates = 0;
+    for (const auto& record : conduit->changeRecords())
+        if (record->type() == CXDUpdateRecord) {
+            ++updates;
+            payloads.insert(record->encodedPayload().get());
+        }
+    EXPECT_GE(updates, 4u);
+    EXPECT_EQ(payloads.size(), 1u);
+    EXPECT_FALSE(payloads.contains(nullptr));
+}
+
+TEST_F(Scan, ClosingSavesTheDatabaseAndMovesTheLastSyncDateToTheEndOfThePass) {
+    conduit->open();
+    person("Ada");
+    EXPECT_TRUE(database.hasUnsavedChanges());
+    clock.advance(10);
+    conduit->close();
+    EXPECT_FALSE(database.hasUnsavedChanges());
+    EXPECT_EQ(conduit->lastSyncDate(), clock.now());
+    EXPECT_EQ(Preferences(directory / "preferences.db").get(kDaemonDomain, "CXDCXConduitLastSyncDate").date(),
+              clock.now())
+        << "the date is synchronised";
+}
+
+TEST_F(Scan, ClosingForgetsRevokedUsers) {
+    engine.priorState("CXDCX").set("bob", Dictionary());
+    engine.revoked = {kBobsLocation};
+    conduit->open();
+    conduit->close();
+    EXPECT_TRUE(engine.priorState("CXDCX").empty());
+}
+
+// -- the journal
+
+namespace {
+
+class Journal : public Scan {
+public:
+    Journal() {
+        delivered = center.observe(kCXDatabaseChangedExternallyNotificationPriv, [this](const Notification& n) {
+            for (const char* key : {kCXInsertedRecords, kCXUpdatedRecords})
+                for (const Value& identifier : n.userInfo[key].array()) seen.push_back(identifier.string());
+        });
+    }
+    // The contact application, another program on the same file.
+    std::unique_ptr<CXRolvane> application() {
+        return std::make_unique<CXRolvane>(CXRolvane::Options{.path = directory / "contacts.db",
+                                                              .program = "rolvane",
+                                                              .clock = &clock,
+                                                              .center = &applicationsCenter,
+                                                              .distributed = nullptr,
+                                                              .runLoop = nullptr});
+    }
+    CXPersonRef edit(CXRolvane& theirs, const char* name) {
+        auto made = CXPerson::create();
+        made->setValue(Value(name), kCXFirstNameProperty);
+        theirs.addRecord(made);
+        theirs.save();
+        return made;
+    }
+    NotificationCenter applicationsCenter;
+    ObservationHandle delivered;
+    Texts seen;
+};
+
+} // namespace
+
+TEST_F(Journal, WhatAScanCapturedIsNotDeliveredOnceMore) {
+    publishAll();
+    save();
+    database.deliverExternalChanges();
+    pass();
+    const auto theirs = application();
+    clock.advance(1);
+    const auto ada = edit(*theirs, "Ada");
+    clock.advance(1);
+    ASSERT_TRUE(database.hasExternalChanges());
+    conduit->open();
+    const Texts found = lines(conduit->changeRecords());
+    EXPECT_EQ(found.empty() ? "" : found[0], "1 <self> " + uid(ada) + " - 4");
+    clock.advance(1);
+    conduit->close();
+    EXPECT_FALSE(database.hasExternalChanges());
+    EXPECT_FALSE(database.deliverExternalChanges());
+    EXPECT_EQ(seen, Texts{});
+}
+
+TEST_F(Journal, AnEditDuringThePassIsDeliveredAfterIt) {
+    publishAll();
+    save();
+    database.deliverExternalChanges();
+    const auto theirs = application();
+    conduit->open();
+    conduit->changeRecords();
+    clock.advance(1);
+    const auto ada = edit(*theirs, "Ada");
+    clock.advance(1);
+    conduit->close();
+    EXPECT_GT(*conduit->lastSyncDate(), ada->valueForProperty(kCXModificationDateProperty).date())
+        << "the next scan alone would not find the edit";
+    ASSERT_TRUE(database.deliverExternalChanges());
+    EXPECT_EQ(seen, Texts{ada->uniqueId().str()});
+    EXPECT_EQ(lines(engine.applied).at(0), "1 <self> " + uid(ada) + " - 4");
+}
+
+TEST_F(Journal, AnEditWhileTheScanItselfReadsIsDeliveredAfterThePass) {
+    publishAll();
+    save();
+    database.deliverExternalChanges();
+    const auto theirs = application();
+    CXPersonRef ada;
+    engine.duringShareCountCheck = [&] { engine.duringShareCountCheck = nullptr; };
+    conduit->open();
+    // The scan asks the engine whose a location is while it reads: the edit comes in there.
+    const auto before = database.journalPosition();
+    conduit->changeRecords();
+    ada = edit(*theirs, "Ada");
+    EXPECT_GT(database.journalPosition(), before);
+    conduit->close();
+    ASSERT_TRUE(database.deliverExternalChanges());
+    EXPECT_EQ(seen, Texts{ada->uniqueId().str()});
+}
+
+TEST_F(Journal, AnEditSavedWhileTheLastPassEndedIsDeliveredAlthoughTheNextScanCannotSeeIt) {
+    publishAll();
+    save();
+    database.deliverExternalChanges();
+    const auto theirs = application();
+    pass();
+    // Its save began before the pass ended: it is dated at the very last-sync date.
+    clock.set(*conduit->lastSyncDate());
+    const auto ada = edit(*theirs, "Ada");
+    clock.advance(5);
+    engine.priorState("CXDCX").dictionaryFor("<self>").remove("AllCXGroup");
+    pass();
+    ASSERT_TRUE(database.deliverExternalChanges());
+    EXPECT_EQ(seen, Texts{ada->uniqueId().str()});
+}
+
+TEST_F(Journal, APassWithoutAScanLeavesTheJournalToTheNotification) {
+    publishAll();
+    save();
+    database.deliverExternalChanges();
+    const auto theirs = application();
+    clock.advance(1);
+    const auto ada = edit(*theirs, "Ada");
+    clock.advance(1);
+    conduit->open();
+    conduit->close();
+    ASSERT_TRUE(database.deliverExternalChanges());
+    EXPECT_EQ(seen, Texts{ada->uniqueId().str()});
+}
+
+TEST_F(Journal, AScanOfAPassThatNeverEndedCountsForNothing) {
+    publishAll();
+    save();
+    database.deliverExternalChanges();
+    const auto theirs = application();
+    clock.advance(1);
+    const auto ada = edit(*theirs, "Ada");
+    clock.advance(1);
+    conduit->open();
+    conduit->changeRecords();
+    conduit->open(); // the next pass, without a scan
+    conduit->close();
+    ASSERT_TRUE(database.deliverExternalChanges());
+    EXPECT_EQ(seen, Texts{ada->uniqueId().str()});
+}
