@@ -90,10 +90,10 @@ std::optional<Url> CXDVaultraConduit::baseLocationOf(const CXDChangeRecord& reco
 
 int CXDVaultraConduit::testReachability() {
     CXDAVError error;
-    const auto address = Url::parse(_world.manager.account().endpointOrigin());
+    const std::vector<std::string> origins = _world.manager.account().origins();
+    const std::string address = origins.empty() ? "" : Url(origins.front() + "/").host();
     // Without a route nobody is asked, so nobody can refuse the password either.
-    const bool online =
-        _world.network.canReachAddress(address ? address->host() : "") && _world.manager.canReach(error);
+    const bool online = _world.network.canReachAddress(address) && _world.manager.canReach(error);
     _vaultraOffLine = !online;
     CXDLog("Vaultra is %@", online ? "online" : "offline");
     return error.code;
