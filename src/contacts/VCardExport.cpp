@@ -47,6 +47,7 @@ size_t VCardExport::exportAll() {
     for (const auto& listing : _rolvane.listGroups(RemoteLocation("")))
         if (auto group = std::dynamic_pointer_cast<CXGroup>(_rolvane.recordForUniqueId(listing.uniqueId)))
             writeGroup(group);
+    finish();
     return _cards;
 }
 
@@ -65,6 +66,7 @@ size_t VCardExport::exportRecords(const std::vector<UniqueId>& uids) {
             writeMembersOf(group);
     }
     for (const auto& group : _groupsToWrite) writeGroup(group);
+    finish();
     return _cards;
 }
 
@@ -129,10 +131,20 @@ void VCardExport::addChoices(VCardEntity& card, const CXGroupRef& group) {
 
 void VCardExport::write(const VCardEntity& card) {
     _out << vcardText(card, _version);
+    check();
+    _cards++;
+}
+
+// A stream holds text back; only what it has handed on is written.
+void VCardExport::finish() {
+    _out.flush();
+    check();
+}
+
+void VCardExport::check() {
     if (!_out)
         throw CXException(kCXVCardException,
                           std::string("the vCards cannot be written: ") + std::strerror(errno ? errno : EIO));
-    _cards++;
 }
 
 } // namespace rolvane

@@ -39,6 +39,8 @@ private:
     void writeGroup(const CXGroupRef& group);
     void addChoices(VCardEntity& card, const CXGroupRef& group);
     void write(const VCardEntity& card);
+    void finish();
+    void check();
     std::string uidTextOf(const UniqueId& uid) const;
 
     CXRolvane& _rolvane;
