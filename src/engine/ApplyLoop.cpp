@@ -1,0 +1,206 @@
+#include "engine/ApplyLoop.h"
+
+#include "contacts/CXRolvane.h"
+#include "engine/ChangeQueue.h"
+#include "engine/Mingler.h"
+#include "engine/OutOfOrderWork.h"
+#include "engine/PublicationCache.h"
+#include "foundation/CXException.h"
+#include "foundation/Log.h"
+
+#include <algorithm>
+#include <iterator>
+#include <utility>
+
+namespace rolvane {
+
+namespace {
+
+constexpr const char* kThreadCountKey = "CXDThreadCountKey";
+constexpr int64_t kDefaultWorkers = 3;
+constexpr int64_t kMostWorkers = 10;
+
+void append(CXDChangeRecords& to, CXDChangeRecords&& from) {
+    to.insert(to.end(), std::make_move_iterator(from.begin()), std::make_move_iterator(from.end()));
+}
+
+CXDChangeRecords mingled(const CXDChangeRecords& input) {
+    Mingler mingler;
+    for (const CXDChangeRecordPtr& record : input) mingler.mingle(record);
+    return mingler.takeMingled();
+}
+
+} // namespace
+
+void saveACLs(EngineParts& parts) {
+    parts.conduits.vaultra->saveACLs();
+    parts.conduits.cx->saveACLs();
+}
+
+ApplyLoop::ApplyLoop(EngineParts& parts, Actions actions) : _parts(parts), _actions(std::move(actions)) {}
+ApplyLoop::~ApplyLoop() = default;
+
+void ApplyLoop::run(CXDChangeRecords records, bool trickle, bool allowRetry) {
+    _unhandled = std::move(records);
+    updateStateAndExitIfNeeded(_parts);
+    _parts.with.progress.startedPhase(2);
+    _actions.persist();
+
+    std::exception_ptr foreign;
+    try {
+        applyAll(trickle);
+    } catch (const CXException& e) {
+        CXLog("applyChangeRecords: Caught %@: %@", e.name(), e.reason());
+    } catch (...) {
+        foreign = std::current_exception();
+    }
+    cleanUp();
+    if (foreign) std::rethrow_exception(foreign);
+
+    try {
+        storeAndClose(allowRetry);
+    } catch (const CXException& e) {
+        CXLog("applyChangeRecords close: Caught %@: %@", e.name(), e.reason());
+    }
+    _parts.revoked.clear();
+    bumpShareCount();
+    _parts.with.progress.stop();
+    _actions.persist();
+}
+
+void ApplyLoop::applyAll(bool trickle) {
+    if (trickle) {
+        CXDLog("TRICKLE");
+        _parts.conduits.cx->open();
+        _parts.conduits.vaultra->open();
+    }
+    append(_unhandled, _parts.state.getPendingChanges());
+    _queueTaken = true;
+    queue();
+    _parts.with.progress.startedPhase(3);
+    split();
+    applyOutOfOrder();
+    applyInOrder();
+}
+
+void ApplyLoop::queue() {
+    CXDChangeRecords accepted = mingled(_unhandled);
+    CXDLog("Mingled: %@", accepted);
+    CXDChangeRecords flat = flattenGroupChanges(accepted);
+    std::stable_sort(flat.begin(), flat.end(),
+                     [](const CXDChangeRecordPtr& a, const CXDChangeRecordPtr& b) { return a->compare(*b) < 0; });
+    _totalCount = flat.size();
+    _processedCount = 0;
+    CXDLog("Flat: %@", flat);
+    _unhandled = std::move(flat);
+}
+
+void ApplyLoop::split() {
+    for (const CXDChangeRecordPtr& record : _unhandled) _parts.with.progress.willProcessChangeRecord(record);
+    CXDChangeRecords outOfOrder;
+    for (CXDChangeRecordPtr& record : _unhandled)
+        (record->canApplyOutOfOrder() ? outOfOrder : _inOrder).push_back(std::move(record));
+    _unhandled.clear();
+    _outOfOrder = std::make_unique<OutOfOrderWork>(_parts, std::move(outOfOrder));
+}
+
+void ApplyLoop::applyOutOfOrder() {
+    const int64_t configured =
+        _parts.with.account.configValueForKey(kThreadCountKey, kDefaultWorkers).integer(kDefaultWorkers);
+    _outOfOrder->start(std::min(configured, kMostWorkers));
+    _outOfOrder->wait();
+    _processedCount += _outOfOrder->processedCount();
+}
+
+void ApplyLoop::applyInOrder() {
+    for (; _inOrderDone < _inOrder.size(); ++_inOrderDone) {
+        const CXDChangeRecordPtr& record = _inOrder[_inOrderDone];
+        applyInOrder(record);
+        ++_processedCount;
+        _parts.with.progress.didProcessChangeRecord(record);
+    }
+}
+
+void ApplyLoop::applyInOrder(const CXDChangeRecordPtr& record) {
+    int32_t left = record->appliesToSources();
+    if (!_parts.terminating) {
+        if ((left & CXDSyncSourceCX) && applyTo(*_parts.conduits.cx, CXDSyncSourceCX, record)) left &= ~CXDSyncSourceCX;
+        if (left & CXDSyncSourceVaultra) {
+            if (applyTo(*_parts.conduits.vaultra, CXDSyncSourceVaultra, record)) left &= ~CXDSyncSourceVaultra;
+            if (_denied) cancelLike(record);
+        }
+    }
+    if (left) {
+        record->setAppliesToSources(left);
+        _pendingChanges.push_back(record);
+    }
+    record->packPayload();
+}
+
+bool ApplyLoop::applyTo(CXDConduit& conduit, int32_t source, const CXDChangeRecordPtr& record) {
+    if (!conduit.applyChangeRecordIfNeeded(record, &_denied)) return false;
+    _parts.state.withConduitData([&](Dictionary& data) { didApplyChange(data, *record, source); });
+    return true;
+}
+
+// The list stays the same for the whole pass, so one walk a user is enough.
+void ApplyLoop::cancelLike(const CXDChangeRecordPtr& record) {
+    const bool walk = record->user() && _cancelledUsers.insert(*record->user()).second;
+    _parts.denied.cancelLike(record, walk ? _inOrder : CXDChangeRecords());
+}
+
+void ApplyLoop::cleanUp() {
+    try {
+        saveACLs(_parts);
+    } catch (const CXException& e) {
+        CXLog("applyChangeRecords: Caught %@: %@", e.name(), e.reason());
+    }
+    carryOver();
+    _parts.locks.unlockAllURLs();
+}
+
+// After a pass that ran to its end this gathers what the workers left; after an exception also what nobody came to.
+void ApplyLoop::carryOver() {
+    if (_outOfOrder) {
+        _outOfOrder->finish();
+        CXDChangeRecords pending = _outOfOrder->takePending();
+        append(pending, std::move(_pendingChanges));
+        append(pending, _outOfOrder->takeUntouched());
+        _pendingChanges = std::move(pending);
+        _outOfOrder.reset();
+    }
+    for (; _inOrderDone < _inOrder.size(); ++_inOrderDone) {
+        const CXDChangeRecordPtr& record = _inOrder[_inOrderDone];
+        if (_pendingChanges.empty() || _pendingChanges.back() != record) _pendingChanges.push_back(record);
+    }
+    _inOrder.clear();
+    append(_pendingChanges, std::move(_unhandled));
+    _unhandled.clear();
+}
+
+void ApplyLoop::storeAndClose(bool allowRetry) {
+    if (!_queueTaken) append(_pendingChanges, _parts.state.getPendingChanges());
+    std::erase_if(_pendingChanges, [&](const CXDChangeRecordPtr& record) { return _parts.denied.contains(*record); });
+    CXDLog("Pending: %@", _pendingChanges);
+    CXDLog("Denied:  %@", _parts.denied.all());
+    _parts.state.setPendingChanges(_pendingChanges);
+    _pendingChanges.clear();
+    if (!_parts.denied.empty()) {
+        _parts.denied.clear();
+        if (allowRetry) _actions.scheduleRetry();
+    }
+    _parts.conduits.cx->close();
+    _parts.conduits.vaultra->close();
+}
+
+// Account and conduit data are put down first, so that they reach the disk in one piece with the share count.
+void ApplyLoop::bumpShareCount() {
+    const std::optional<UserName> user = _parts.with.account.vaultraUser();
+    Preferences& preferences = _parts.with.preferences;
+    preferences.set(kDaemonDomain, kCXDLastOstrelUser, user ? Value(*user) : Value());
+    _parts.state.putConduitData();
+    _parts.with.rolvane.bumpShareCount(preferences);
+    preferences.synchronize(kDaemonDomain);
+}
+
+} // namespace rolvane

@@ -1,0 +1,63 @@
+#pragma once
+
+#include "engine/EngineParts.h"
+#include "model/CXDChangeRecord.h"
+
+#include <exception>
+#include <functional>
+#include <memory>
+#include <unordered_set>
+
+namespace rolvane {
+
+class OutOfOrderWork;
+
+// One apply pass, from the records that were gathered to the queue that is left. Built for one pass on the main thread.
+//
+// Nothing is lost on the way: what an exception leaves unhandled stays pending, and the stored queue is replaced only
+// after it has been read. The durable steps of the end come in this order: queue, last-sync dates (the conduits'
+// `close`), then account, conduit data and share count together. A crash between any two of them makes the next pass
+// find some changes again, and applying them again changes nothing.
+class ApplyLoop {
+public:
+    struct Actions {
+        std::function<void()> persist;       // arms the idle-exit timer
+        std::function<void()> scheduleRetry; // one more full pass on the run loop, which schedules no other
+    };
+    ApplyLoop(EngineParts& parts, Actions actions);
+    ~ApplyLoop();
+
+    // applyChangeRecords:trickle:allowRetry:
+    void run(CXDChangeRecords records, bool trickle, bool allowRetry);
+
+private:
+    void applyAll(bool trickle);
+    void queue(); // _unhandled becomes the flat list
+    void split();
+    void applyOutOfOrder();
+    void applyInOrder();
+    void applyInOrder(const CXDChangeRecordPtr& record);
+    bool applyTo(CXDConduit& conduit, int32_t source, const CXDChangeRecordPtr& record);
+    void cancelLike(const CXDChangeRecordPtr& record);
+    void cleanUp();
+    void carryOver();
+    void storeAndClose(bool allowRetry);
+    void bumpShareCount();
+
+    EngineParts& _parts;
+    Actions _actions;
+    CXDChangeRecords _unhandled; // what an exception would leave behind: the input, then the flat list
+    bool _queueTaken = false;    // the stored queue is part of the pass
+    CXDChangeRecords _pendingChanges;
+    CXDChangeRecords _inOrder;
+    size_t _inOrderDone = 0;
+    std::unique_ptr<OutOfOrderWork> _outOfOrder;
+    bool _denied = false; // handed to every in-order apply; never cleared in a pass
+    std::unordered_set<UserName> _cancelledUsers;
+    size_t _totalCount = 0, _processedCount = 0;
+};
+
+// saveACLs: the network store's lists, then the contact database's.
+void saveACLs(EngineParts& parts);
+
+} // namespace rolvane

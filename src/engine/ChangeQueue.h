@@ -1,0 +1,18 @@
+#pragma once
+
+#include "model/CXDChangeRecord.h"
+
+namespace rolvane {
+
+// The group identifier that stands for all contacts; its changes are never folded.
+inline const UniqueId kPeopleGroup{"People"};
+
+// Splits group changes into one record a source and folds the changes of one group into one composite, which takes the
+// place of the group's last change. O(C) expected.
+//
+// A fold starts at a change that is addressed to something other than the contact database alone and is no composite,
+// access-list change or deletion; it then takes in every earlier change of that group, whatever its type and sources.
+// What merging refuses (CXDChangeRecord::canBeMerged, or a payload that cannot be read) stands for itself.
+CXDChangeRecords flattenGroupChanges(const CXDChangeRecords& records);
+
+} // namespace rolvane

@@ -1,0 +1,116 @@
+#include "engine/EngineParts.h"
+
+#include "contacts/CXRolvane.h"
+#include "foundation/Log.h"
+#include "model/PayloadKeys.h"
+#include "model/RemoteLocationMap.h"
+
+#include <cstdlib>
+#include <utility>
+
+namespace rolvane {
+
+namespace {
+
+std::unique_ptr<InterruptibleSleep> sleepOf(const EngineCollaborators& collaborators) {
+    if (!collaborators.renewalSleep) return makeInterruptibleSleep();
+    // The engine's handle on a sleep that the test keeps.
+    class Borrowed : public InterruptibleSleep {
+    public:
+        explicit Borrowed(std::shared_ptr<InterruptibleSleep> sleep) : _sleep(std::move(sleep)) {}
+        bool sleep(double seconds) override { return _sleep->sleep(seconds); }
+        void interrupt() override { _sleep->interrupt(); }
+
+    private:
+        std::shared_ptr<InterruptibleSleep> _sleep;
+    };
+    return std::make_unique<Borrowed>(collaborators.renewalSleep);
+}
+
+// A single value that is missing, or a user without a name.
+bool isEmpty(const std::optional<UserName>& user) {
+    return !user || user->empty();
+}
+
+} // namespace
+
+EngineParts::EngineParts(const EngineCollaborators& collaborators)
+    : with(collaborators), state(collaborators.preferences),
+      locks(collaborators.makeLock, collaborators.clock, sleepOf(collaborators)) {}
+
+void killCXD(const EngineParts& parts) {
+    parts.with.progress.stop();
+    if (std::this_thread::get_id() == parts.mainThread) {
+        parts.ending = true; // whatever arrives in that turn starts no pass
+        parts.with.runLoop.runOnce(0);
+    }
+    CXDLog("Killing RolvaneManager");
+    parts.with.processEnd.end(0);
+    std::abort(); // an end that returns is no end
+}
+
+void checkCXShareCount(EngineParts& parts) {
+    Preferences& preferences = parts.with.preferences;
+    const auto sameDatabase = [&] {
+        return preferences.get(kDaemonDomain, kCXDShareCount).integer() == parts.with.rolvane.shareCount();
+    };
+    if (!preferences.get(kDaemonDomain, kCXDShareCount)) {
+        CXDLog("First Sync");
+    } else if (!sameDatabase()) {
+        // A crash or a failed save may have stopped between the two counts.
+        parts.with.rolvane.recoverShareCount(preferences);
+        if (!sameDatabase()) {
+            parts.state.reset();
+            return;
+        }
+    }
+    const std::optional<std::string> last = preferences.get(kDaemonDomain, kCXDLastOstrelUser).optionalString();
+    const std::optional<UserName> user = parts.with.account.vaultraUser();
+    if (!user || !last || user->str() != *last) parts.state.reset();
+}
+
+void updateStateAndExitIfNeeded(EngineParts& parts) {
+    CXRolvane& rolvane = parts.with.rolvane;
+    size_t subscriptions = 0;
+    bool save = false;
+    const CXAllGroupRef allGroup = rolvane.allGroup();
+    if (isEmpty(parts.with.account.vaultraUser())) {
+        for (const CXSubscriptionRef& subscription : rolvane.subscriptions())
+            if (!subscription->isLocal()) rolvane.removeRecord(subscription);
+        allGroup->removeValueForProperty(kCXRemoteLocationProperty);
+        save = true;
+    } else {
+        subscriptions = rolvane.subscriptions().size();
+    }
+
+    const bool publishes = static_cast<bool>(allGroup->valueForProperty(kCXRemoteLocationProperty));
+    if (!publishes) {
+        parts.state.conduitObjectForKey(kConduitCX, kPriorState).remove(kSelf.str());
+        parts.state.conduitObjectForKey(kConduitVaultra, kPriorState).remove(kSelf.str());
+        parts.state.syncPrefs();
+    }
+    removeCacheDataForConduit(parts, *parts.conduits.vaultra);
+    if (save) rolvane.save();
+    // Two, not one: an owner who publishes nothing and has one subscription (the built-in one) is not served.
+    if (!publishes && subscriptions < 2) killCXD(parts);
+}
+
+void removeCacheDataForConduit(EngineParts& parts, CXDConduit& conduit) {
+    const std::string id = conduit.conduitID().value_or("");
+    Dictionary users = parts.state.conduitObjectForKey(id, kPriorState);
+    bool removed = false;
+    for (const std::string& user : users.allKeys()) {
+        if (user == kSelf.str()) continue;
+        const std::optional<Url> base = conduit.baseLocationForUser(UserName(user));
+        const RemoteLocation location(base ? base->absoluteString() : std::string());
+        if (base && parts.with.rolvane.findSubscriptionWithRemoteLocation(location)) continue;
+        CXDLog("Removing truth data for %@ (%@)", user, id);
+        parts.state.conduitObjectForKey(kConduitCX, kPriorState).remove(user);
+        parts.state.conduitObjectForKey(kConduitVaultra, kPriorState).remove(user);
+        if (base) parts.state.removeSubscriptionMapForRemoteLocation(location);
+        removed = true;
+    }
+    if (removed) parts.state.syncPrefs();
+}
+
+} // namespace rolvane

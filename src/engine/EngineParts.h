@@ -1,0 +1,48 @@
+#pragma once
+
+#include "conduits/CXDConduit.h"
+#include "engine/DeniedChanges.h"
+#include "engine/EngineCollaborators.h"
+#include "engine/EngineState.h"
+#include "engine/RemoteLocks.h"
+#include "engine/Revocation.h"
+
+#include <atomic>
+#include <thread>
+
+namespace rolvane {
+
+// What the engine's subjects share. Owned by CXDSyncEngine; lives as long as it does.
+//
+// Locks, each taken alone: RemoteLocks' list, OutOfOrderWork's two, and the leaves of DeniedChanges, Revocation and
+// EngineState. The conduit data's lock is also taken under OutOfOrderWork's lock of processed changes.
+struct EngineParts {
+    explicit EngineParts(const EngineCollaborators& collaborators);
+
+    EngineCollaborators with;
+    EngineState state;
+    DeniedChanges denied;
+    Revocation revoked;
+    RemoteLocks locks;
+    EngineConduits conduits;
+    std::atomic<bool> terminating{false}; // passes wind down: what is not applied yet stays pending
+    mutable bool ending = false;          // killCXD has begun; main thread
+    bool retryScheduled = false;          // a retry pass waits on the run loop; main thread
+    const std::thread::id mainThread = std::this_thread::get_id();
+
+    bool vaultraOffLine() const { return conduits.vaultraOffLine && conduits.vaultraOffLine(); }
+};
+
+// Ends the process: progress stops, the run loop turns once so that what is queued goes out, exit status 0.
+// From another thread than the main one the run loop is left alone.
+[[noreturn]] void killCXD(const EngineParts& parts);
+
+// checkCXShareCount: forgets everything when the database is not the one of the last pass, or the account is another.
+void checkCXShareCount(EngineParts& parts);
+// updateStateAndExitIfNeeded: without an account no remote subscription and no publication are left; with nothing
+// published and fewer than two subscriptions the process ends.
+void updateStateAndExitIfNeeded(EngineParts& parts);
+// removeCacheDataForConduit:. Forgets users of the conduit to whom there is no subscription any more.
+void removeCacheDataForConduit(EngineParts& parts, CXDConduit& conduit);
+
+} // namespace rolvane

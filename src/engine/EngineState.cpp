@@ -1,0 +1,125 @@
+#include "engine/EngineState.h"
+
+#include "foundation/CXException.h"
+#include "foundation/KeyedArchive.h"
+#include "foundation/Log.h"
+
+#include <utility>
+
+namespace rolvane {
+
+namespace {
+constexpr const char* kSubscriptionMap = "subscriptionMap";
+constexpr const char* kRecordClass = "CXDChangeRecord";
+} // namespace
+
+Dictionary EngineState::loadedConduitData() {
+    if (!_conduitData) {
+        const Value stored = _preferences.get(kDaemonDomain, kCXDConduitData);
+        _conduitData = stored.isDictionary() ? stored.deepMutableCopy().dictionary() : Dictionary();
+    }
+    return *_conduitData;
+}
+
+Dictionary EngineState::conduitData() {
+    const std::lock_guard guard(_lock);
+    return loadedConduitData();
+}
+
+void EngineState::dropConduitData() {
+    const std::lock_guard guard(_lock);
+    _conduitData.reset();
+}
+
+void EngineState::withConduitData(const std::function<void(Dictionary&)>& use) {
+    const std::lock_guard guard(_lock);
+    Dictionary data = loadedConduitData();
+    use(data);
+}
+
+Dictionary EngineState::conduitObjectForKey(const std::string& conduitID, const std::string& key) {
+    const std::lock_guard guard(_lock);
+    return loadedConduitData().dictionaryFor(conduitID).dictionaryFor(key);
+}
+
+void EngineState::setConduitObjectForKey(const std::string& conduitID, const Value& object, const std::string& key) {
+    const std::lock_guard guard(_lock);
+    loadedConduitData().dictionaryFor(conduitID).set(key, object);
+}
+
+void EngineState::putConduitData() {
+    _preferences.set(kDaemonDomain, kCXDConduitData, conduitData());
+}
+
+void EngineState::syncPrefs() {
+    putConduitData();
+    _preferences.synchronize(kDaemonDomain);
+}
+
+CXDChangeRecords EngineState::getPendingChanges() const {
+    const Value stored = _preferences.get(kDaemonDomain, kCXDPendingChanges);
+    CXDChangeRecords records;
+    if (!stored.isData()) return records;
+    try {
+        for (KeyedArchive::Object& object : KeyedArchive::unarchive(stored.data()))
+            if (object.className == kRecordClass)
+                records.push_back(std::make_shared<CXDChangeRecord>(DictionaryCoder(std::move(object.keys))));
+    } catch (const CXException&) {
+        records.clear();
+    }
+    return records;
+}
+
+void EngineState::setPendingChanges(const CXDChangeRecords& records) {
+    std::vector<KeyedArchive::Object> objects;
+    objects.reserve(records.size());
+    for (const CXDChangeRecordPtr& record : records) {
+        DictionaryCoder coder;
+        record->encodeWithCoder(coder);
+        objects.push_back({kRecordClass, coder.entries()});
+    }
+    _preferences.set(kDaemonDomain, kCXDPendingChanges, KeyedArchive::archive(objects));
+    _preferences.synchronize(kDaemonDomain);
+}
+
+void EngineState::setRemoteLocationForSubscriptionUID(const std::optional<RemoteLocation>& location,
+                                                      const std::optional<UniqueId>& subscription) {
+    if (!location || !subscription) return;
+    const std::lock_guard guard(_lock);
+    loadedConduitData().dictionaryFor(kSubscriptionMap).set(subscription->str(), *location);
+}
+
+std::optional<RemoteLocation> EngineState::remoteLocationForSubscriptionUID(const UniqueId& subscription) {
+    const std::lock_guard guard(_lock);
+    const Value map = loadedConduitData()[kSubscriptionMap];
+    const Dictionary* locations = map.dictionaryIf();
+    const std::string* location = locations ? (*locations)[subscription.str()].stringIf() : nullptr;
+    return location ? std::optional(RemoteLocation(*location)) : std::nullopt;
+}
+
+void EngineState::removeSubscriptionMapForRemoteLocation(const RemoteLocation& location) {
+    const std::lock_guard guard(_lock);
+    const Value map = loadedConduitData()[kSubscriptionMap];
+    if (!map.isDictionary()) return;
+    Dictionary locations = map.dictionary();
+    for (const std::string& subscription : locations.allKeys())
+        if (locations[subscription] == Value(location)) locations.remove(subscription);
+}
+
+void EngineState::removeSubscription(const UniqueId& subscription) {
+    const std::lock_guard guard(_lock);
+    const Value map = loadedConduitData()[kSubscriptionMap];
+    if (map.isDictionary()) map.dictionary().remove(subscription.str());
+}
+
+void EngineState::reset() {
+    CXDLog("Reset!");
+    for (const char* key :
+         {kCXDPendingChanges, kCXDConduitData, kCXDVaultraConduitLastSyncDate, kCXDCXConduitLastSyncDate,
+          kCXDLocalConduitLastSyncDate, kCXDShareCount, kCXDLastOstrelUser})
+        _preferences.remove(kDaemonDomain, key);
+    _preferences.synchronize(kDaemonDomain);
+    dropConduitData();
+}
+
+} // namespace rolvane

@@ -1,0 +1,61 @@
+#pragma once
+
+#include "foundation/Preferences.h"
+#include "foundation/StrongString.h"
+#include "foundation/Value.h"
+#include "model/CXDChangeRecord.h"
+
+#include <functional>
+#include <mutex>
+#include <optional>
+#include <string>
+
+namespace rolvane {
+
+// Keys of the daemon's domain.
+inline constexpr const char* kCXDPendingChanges = "CXDPendingChanges";
+inline constexpr const char* kCXDConduitData = "CXDConduitData";
+inline constexpr const char* kCXDVaultraConduitLastSyncDate = "CXDVaultraConduitLastSyncDate";
+inline constexpr const char* kCXDCXConduitLastSyncDate = "CXDCXConduitLastSyncDate";
+inline constexpr const char* kCXDLocalConduitLastSyncDate = "CXDLocalConduitLastSyncDate";
+inline constexpr const char* kCXDShareCount = "CXDShareCount";
+inline constexpr const char* kCXDLastOstrelUser = "CXDLastOstrelUser";
+
+// The engine's memory: the conduit data and the queue, in the daemon's preferences. The conduit data is read on first
+// need and lives in memory until it is dropped. Finding a conduit's dictionary is safe on any thread; the dictionaries
+// that are found are shared and have no lock. Everything else on the main thread.
+class EngineState {
+public:
+    explicit EngineState(Preferences& preferences) : _preferences(preferences) {}
+
+    Dictionary conduitData();
+    void dropConduitData(); // the next use reads it again
+    void withConduitData(const std::function<void(Dictionary&)>& use);
+    Dictionary conduitObjectForKey(const std::string& conduitID, const std::string& key); // made empty when absent
+    void setConduitObjectForKey(const std::string& conduitID, const Value& object, const std::string& key);
+    void putConduitData(); // without synchronising
+    void syncPrefs();      // putConduitData, then synchronise
+
+    // A queue that cannot be read is empty.
+    CXDChangeRecords getPendingChanges() const;
+    void setPendingChanges(const CXDChangeRecords& records);
+
+    // Subscription identifier to remote location. Nothing happens when one of the two is missing.
+    void setRemoteLocationForSubscriptionUID(const std::optional<RemoteLocation>& location,
+                                             const std::optional<UniqueId>& subscription);
+    std::optional<RemoteLocation> remoteLocationForSubscriptionUID(const UniqueId& subscription);
+    void removeSubscriptionMapForRemoteLocation(const RemoteLocation& location); // every subscription to it
+    void removeSubscription(const UniqueId& subscription);
+
+    void reset(); // forgets everything, durably
+    Preferences& preferences() const { return _preferences; }
+
+private:
+    Dictionary loadedConduitData(); // with _lock held
+
+    Preferences& _preferences;
+    std::mutex _lock;
+    std::optional<Dictionary> _conduitData; // guarded by _lock
+};
+
+} // namespace rolvane

@@ -1,0 +1,40 @@
+#pragma once
+
+#include "model/CXDChangeRecord.h"
+
+#include <cstddef>
+#include <memory>
+#include <unordered_map>
+
+namespace rolvane {
+
+// Settles conflicts among the records of a pass: duplicates are dropped, and the owner's change wins over a
+// subscriber's when one takes something away and the other does not. Records go in one by one, in order of arrival; the
+// accepted ones come out in that order.
+//
+// Every identifier, a person's or a group's, has a bucket of the records accepted for it. A record is compared with its
+// buckets' elements from the latest to the earliest. A long bucket is indexed by what can equal or contradict a
+// record, so that a pass of C records costs O(C) expected, whatever the sizes of the groups.
+// One pass, one thread, then discarded.
+class Mingler {
+public:
+    // A bucket of `indexFrom` elements gets its index.
+    explicit Mingler(size_t indexFrom = 16);
+    ~Mingler();
+
+    // mingleChange:from:intoBuckets:, and the record is appended to the mingled list when it is accepted. True then.
+    // A record that a bucket accepts is accepted, even if its other bucket rejects it; one without identifiers is not.
+    bool mingle(const CXDChangeRecordPtr& record);
+    CXDChangeRecords takeMingled();
+
+private:
+    class Bucket;
+    class List;
+    bool mingleIntoBucket(const UniqueId& identifier, const CXDChangeRecordPtr& record);
+
+    size_t _indexFrom;
+    std::unique_ptr<List> _mingled;
+    std::unordered_map<UniqueId, std::unique_ptr<Bucket>> _buckets;
+};
+
+} // namespace rolvane

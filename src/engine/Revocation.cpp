@@ -1,0 +1,41 @@
+#include "engine/Revocation.h"
+
+#include "engine/EngineState.h"
+#include "model/PayloadKeys.h"
+#include "model/RemoteLocationMap.h"
+
+namespace rolvane {
+
+void Revocation::revoke(EngineState& state, const RemoteLocation& location, const UserName& user,
+                        const std::optional<UniqueId>& subscription) {
+    {
+        const std::lock_guard guard(_lock);
+        _locations.push_back(location);
+        _known.insert(location);
+    }
+    state.conduitObjectForKey(kConduitVaultra, kPriorState).remove(user.str());
+    state.conduitObjectForKey(kConduitCX, kPriorState).remove(user.str());
+    if (subscription) state.removeSubscription(*subscription);
+
+    CXDChangeRecords pending = state.getPendingChanges();
+    const size_t removed = std::erase_if(pending, [&](const CXDChangeRecordPtr& r) { return r->user() == user; });
+    if (removed) state.setPendingChanges(pending);
+}
+
+bool Revocation::contains(const RemoteLocation& location) const {
+    const std::lock_guard guard(_lock);
+    return _known.count(location) != 0;
+}
+
+std::vector<RemoteLocation> Revocation::all() const {
+    const std::lock_guard guard(_lock);
+    return _locations;
+}
+
+void Revocation::clear() {
+    const std::lock_guard guard(_lock);
+    _locations.clear();
+    _known.clear();
+}
+
+} // namespace rolvane

@@ -1,0 +1,206 @@
+#include "EngineWorld.h"
+
+#include <filesystem>
+#include <fstream>
+#include <gtest/gtest.h>
+#include <sqlite3.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+namespace rolvane {
+namespace {
+
+namespace fs = std::filesystem;
+using test::makeRecord;
+using test::update;
+using test::World;
+
+// Ends the process, as a kill does, before the given write of a database or preferences file.
+class KillBeforeWrite {
+public:
+    explicit KillBeforeWrite(int write) {
+        left = write;
+        sqlite3_vfs* vfs = sqlite3_vfs_find(nullptr);
+        const auto replace = [&](const char* name, sqlite3_syscall_ptr with) {
+            if (vfs->xGetSystemCall(vfs, name)) vfs->xSetSystemCall(vfs, name, with);
+        };
+        replace("write", reinterpret_cast<sqlite3_syscall_ptr>(countedWrite));
+        replace("pwrite", reinterpret_cast<sqlite3_syscall_ptr>(countedPwrite));
+        replace("pwrite64", reinterpret_cast<sqlite3_syscall_ptr>(countedPwrite));
+        replace("ftruncate", reinterpret_cast<sqlite3_syscall_ptr>(countedTruncate));
+        replace("unlink", reinterpret_cast<sqlite3_syscall_ptr>(countedUnlink));
+    }
+
+private:
+    static int left;
+    static void count() {
+        if (left-- == 0) ::_exit(kKilled);
+    }
+    static ssize_t countedWrite(int fd, const void* bytes, size_t size) {
+        count();
+        return ::write(fd, bytes, size);
+    }
+    static ssize_t countedPwrite(int fd, const void* bytes, size_t size, off_t at) {
+        count();
+        return ::pwrite(fd, bytes, size, at);
+    }
+    static int countedTruncate(int fd, off_t size) {
+        count();
+        return ::ftruncate(fd, size);
+    }
+    static int countedUnlink(const char* path) {
+        count();
+        return ::unlink(path);
+    }
+
+public:
+    static constexpr int kKilled = 9;
+};
+int KillBeforeWrite::left = 0;
+
+const std::vector<std::string> kPeople{"P1:CXPerson", "P2:CXPerson", "P3:CXPerson"};
+constexpr const char* kGroup = "G1:CXGroup";
+
+// A daemon whose contact source finds what is new since its last-sync date and compares its group with the prior state,
+// and whose store is a folder: a file a person, one for the group's members, and a line in a log a write.
+class Daemon {
+public:
+    explicit Daemon(const std::string& root) : world(true, root), store(root + "/store") {
+        fs::create_directories(store);
+        world.prepare = [this] { connect(); };
+        world.start();
+    }
+    void pass() { world.engine->bringSourcesUpToDate(); }
+
+    std::set<std::string> people() const {
+        std::set<std::string> names;
+        for (const auto& entry : fs::directory_iterator(store)) {
+            std::string name = entry.path().filename();
+            if (name.starts_with("P")) names.insert(name);
+        }
+        return names;
+    }
+    std::set<std::string> members() const { return linesOf("members"); }
+    size_t writes() const {
+        std::ifstream log(store + "/log");
+        return static_cast<size_t>(std::count(std::istreambuf_iterator<char>(log), {}, '\n'));
+    }
+    std::vector<std::string> stateOf(const char* conduit) const {
+        std::vector<std::string> names;
+        for (const Value& v : memberState(conduit)) names.push_back(v.string());
+        std::sort(names.begin(), names.end());
+        return names;
+    }
+
+    World world;
+    const std::string store;
+
+private:
+    std::set<std::string> linesOf(const std::string& file) const {
+        std::set<std::string> lines;
+        std::ifstream in(store + "/" + file);
+        for (std::string line; std::getline(in, line);) lines.insert(line);
+        return lines;
+    }
+    Array memberState(const char* conduit) const {
+        return world.engine->conduitObjectForKey(conduit, "priorState")["<self>"]
+            .dictionary()[kGroup]
+            .dictionary()["memberUIDState"]
+            .array();
+    }
+    void connect() {
+        world.cx->whenGathering = [this] {
+            CXDChangeRecords found;
+            if (!world.stored("CXDCXConduitLastSyncDate"))
+                for (const std::string& person : kPeople) found.push_back(update(person.c_str()));
+            const Array known = memberState("CXDCX");
+            for (const std::string& person : kPeople)
+                if (!known.containsString(person))
+                    found.push_back(makeRecord(CXDAddRecordToGroup, person.c_str(), kGroup));
+            return found;
+        };
+        world.cx->whenClosing = [this] {
+            world.preferences.set(kDaemonDomain, "CXDCXConduitLastSyncDate", world.clock.now());
+            world.preferences.synchronize(kDaemonDomain);
+        };
+        world.vaultra->whenApplying = [this](const CXDChangeRecordPtr& record, bool*) {
+            const std::lock_guard guard(lock);
+            std::ofstream(store + "/log", std::ios::app) << record->type() << "\n";
+            if (record->person()) std::ofstream(store + "/" + record->person()->str()) << "here";
+            std::set<std::string> now = linesOf("members");
+            for (const Value& v : record->inMemoryPayload().dictionary()["memberAdds"].array()) now.insert(v.string());
+            std::ofstream out(store + "/members");
+            for (const std::string& line : now) out << line << "\n";
+            return true;
+        };
+    }
+    std::mutex lock;
+};
+
+class Crash : public ::testing::Test {
+protected:
+    // A daemon that has run before: its database and its preferences know each other, and one change is queued that
+    // nobody could find again.
+    void SetUp() override {
+        Daemon daemon(before / "daemon");
+        daemon.world.cx->whenGathering = nullptr;
+        daemon.world.cx->whenClosing = nullptr;
+        daemon.pass();
+        daemon.world.engine->setPendingChanges({update("P9:CXPerson")});
+        daemon.world.engine->setConduitObjectForKey("CXDLocal", Dictionary{{"never", "thrown away"}}, "marker");
+        daemon.world.engine->syncPrefs();
+        daemon.world.engine.reset();
+        daemon.world.rolvane.reset();
+    }
+    std::string freshCopy(int number) {
+        std::string root = before / ("copy" + std::to_string(number));
+        fs::copy(before / "daemon", root, fs::copy_options::recursive);
+        return root;
+    }
+    // True when the pass ended before it came to that write.
+    bool passKilledBefore(int write, const std::string& root) {
+        const pid_t child = ::fork();
+        if (child == 0) {
+            Daemon daemon(root);
+            const KillBeforeWrite kill(write);
+            daemon.pass();
+            ::_exit(0);
+        }
+        int status = 0;
+        ::waitpid(child, &status, 0);
+        EXPECT_TRUE(WIFEXITED(status)) << "signal " << WTERMSIG(status);
+        EXPECT_TRUE(WEXITSTATUS(status) == 0 || WEXITSTATUS(status) == KillBeforeWrite::kKilled) << WEXITSTATUS(status);
+        return WEXITSTATUS(status) == 0;
+    }
+    test::TempDirectory before;
+};
+
+TEST_F(Crash, BeforeAnyWriteOfAPassLosesNothingAndDoublesNothing) {
+    const std::set<std::string> everybody{"P1:CXPerson", "P2:CXPerson", "P3:CXPerson", "P9:CXPerson"};
+    int write = 0;
+    for (bool ended = false; !ended; ++write) {
+        const std::string root = freshCopy(write);
+        ended = passKilledBefore(write, root);
+
+        Daemon daemon(root);
+        daemon.pass();
+        SCOPED_TRACE("killed before write " + std::to_string(write));
+        EXPECT_EQ(daemon.people(), everybody);
+        EXPECT_EQ(daemon.members(), std::set<std::string>(kPeople.begin(), kPeople.end()));
+        for (const char* conduit : {"CXDCX", "CXDVaultra"}) EXPECT_EQ(daemon.stateOf(conduit), kPeople) << conduit;
+        EXPECT_TRUE(daemon.world.pending().empty());
+        EXPECT_EQ(daemon.world.stored("CXDShareCount"), Value(daemon.world.rolvane->shareCount()));
+        EXPECT_EQ(daemon.world.engine->conduitObjectForKey("CXDLocal", "marker"),
+                  (Dictionary{{"never", "thrown away"}}))
+            << "the memory was thrown away";
+        const size_t writes = daemon.writes();
+        daemon.pass();
+        EXPECT_EQ(daemon.writes(), writes) << "one more pass has nothing to do";
+        if (HasFailure()) break;
+        fs::remove_all(root);
+    }
+    EXPECT_GT(write, 10) << "the pass has far more writes than were killed";
+}
+
+} // namespace
+} // namespace rolvane

@@ -1,0 +1,136 @@
+#include "engine/ChangeQueue.h"
+
+#include "Records.h"
+
+#include <gtest/gtest.h>
+#include <rapidcheck/gtest.h>
+
+namespace rolvane {
+namespace {
+
+using test::makeRecord;
+
+// Flattening as it reads.
+CXDChangeRecords literalFlat(const CXDChangeRecords& input) {
+    const auto named = [](const CXDChangeRecordPtr& r) { return r->group() && *r->group() != UniqueId("People"); };
+    CXDChangeRecords result, work;
+    for (const CXDChangeRecordPtr& record : input) {
+        if (named(record)) {
+            for (const CXDChangeRecordPtr& part : record->splitChangeRecord()) work.push_back(part);
+        } else {
+            work.push_back(record);
+        }
+    }
+    while (!work.empty()) {
+        const CXDChangeRecordPtr x = work.back();
+        work.pop_back();
+        const int32_t t = x->type();
+        const bool folds = x->appliesToSources() != 1 && named(x) && t != 3 && t != 7 && t != 8 && t != 260 && t != 261;
+        if (!folds || !x->canBeMerged()) {
+            result.insert(result.begin(), x);
+            continue;
+        }
+        auto c = std::make_shared<CXDChangeRecord>(x->initialSource(), 3, x->user(), std::nullopt, x->group());
+        c->setAppliesToSources(x->appliesToSources());
+        c->mergeWithGroupChangeRecord(*x);
+        result.insert(result.begin(), c);
+        for (size_t i = work.size(); i-- > 0;) {
+            if (work[i]->group() != x->group() || !work[i]->canBeMerged()) continue;
+            c->mergeWithGroupChangeRecord(*work[i]);
+            work.erase(work.begin() + static_cast<std::ptrdiff_t>(i));
+        }
+    }
+    return result;
+}
+
+std::string shown(const CXDChangeRecords& records) {
+    std::string text;
+    for (const CXDChangeRecordPtr& r : records) {
+        const std::string line = r->description();
+        text += line.substr(line.find('>') + 1) + r->inMemoryPayload().description() + "\n";
+    }
+    return text;
+}
+
+RC_GTEST_PROP(Flattening, GivesWhatTheLiteralLoopGives, ()) {
+    const auto records = *rc::gen::container<CXDChangeRecords>(test::arbitraryRecord());
+    RC_ASSERT(shown(flattenGroupChanges(records)) == shown(literalFlat(records)));
+}
+
+TEST(Flattening, FoldsTheChangesOfOneGroupIntoACompositeAtTheLastOnesPlace) {
+    const auto other = makeRecord(CXDUpdateRecord, "P9", nullptr);
+    const CXDChangeRecords flat = flattenGroupChanges({
+        makeRecord(CXDAddRecordToGroup, "P1", "G1"),
+        other,
+        makeRecord(CXDAddRecordToGroup, "P2", "G1"),
+        makeRecord(CXDDeleteRecord, "P3", nullptr),
+    });
+    ASSERT_EQ(flat.size(), 3u);
+    EXPECT_EQ(flat[0], other);
+    EXPECT_EQ(flat[1]->type(), CXDCompositeGroupChange);
+    EXPECT_EQ(flat[1]->group(), UniqueId("G1"));
+    EXPECT_FALSE(flat[1]->person());
+    EXPECT_EQ(flat[1]->inMemoryPayload(), Value(Dictionary{{"memberAdds", Array{"P2", "P1"}}}));
+    EXPECT_EQ(flat[2]->type(), CXDDeleteRecord);
+}
+
+TEST(Flattening, ARecordForTheContactDatabaseAloneStartsNoFold) {
+    const CXDChangeRecords flat = flattenGroupChanges({makeRecord(CXDAddRecordToGroup, "P1", "G1", {4, 1, "ann"}),
+                                                       makeRecord(CXDAddRecordToGroup, "P2", "G1", {4, 1, "ann"})});
+    ASSERT_EQ(flat.size(), 2u);
+    EXPECT_EQ(flat[0]->type(), CXDAddRecordToGroup);
+    EXPECT_EQ(flat[1]->person(), UniqueId("P2"));
+}
+
+TEST(Flattening, AccessListChangesDeletionsAndCompositesStartNoFold) {
+    for (const int32_t type : {3, 7, 8, 260, 261}) {
+        const CXDChangeRecords flat = flattenGroupChanges({makeRecord(type, "P1", "G1")});
+        ASSERT_EQ(flat.size(), 1u);
+        EXPECT_EQ(flat[0]->type(), type);
+    }
+}
+
+TEST(Flattening, AFoldTakesInEveryEarlierChangeOfItsGroupWhateverItsTypeAndSources) {
+    const CXDChangeRecords flat = flattenGroupChanges({
+        makeRecord(CXDAddRecordToGroup, "P1", "G1", {4, 1, "ann"}),
+        makeRecord(CXDChangeGroupReadACL, nullptr, "G1"),
+        makeRecord(CXDAddRecordToGroup, "P2", "G1"),
+    });
+    ASSERT_EQ(flat.size(), 1u);
+    EXPECT_EQ(flat[0]->appliesToSources(), CXDSyncSourceVaultra);
+    EXPECT_EQ(flat[0]->inMemoryPayload(), Value(Dictionary{{"memberAdds", Array{"P2", "P1"}}}));
+}
+
+TEST(Flattening, AChangeOfAllContactsPassesUnchangedWithAllItsSources) {
+    const auto record = makeRecord(CXDAddRecordToGroup, "P1", "People", {1, 6, "<self>"});
+    EXPECT_EQ(flattenGroupChanges({record}), CXDChangeRecords{record});
+    EXPECT_EQ(record->appliesToSources(), 6);
+}
+
+TEST(Flattening, SplitsAGroupChangeIntoOneRecordASource) {
+    const CXDChangeRecords flat = flattenGroupChanges({makeRecord(CXDDeleteGroup, nullptr, "G1", {1, 5, "<self>"})});
+    ASSERT_EQ(flat.size(), 2u);
+    EXPECT_EQ(flat[0]->appliesToSources(), 4);
+    EXPECT_EQ(flat[1]->appliesToSources(), 1);
+}
+
+TEST(Flattening, WhatCannotBeMergedStandsForItselfAndStopsNobody) {
+    const CXDChangeRecords flat = flattenGroupChanges(
+        {makeRecord(CXDCreateStructureForGroup, nullptr, "G1"), makeRecord(CXDAddRecordToGroup, "P1", "G1")});
+    ASSERT_EQ(flat.size(), 2u);
+    EXPECT_EQ(flat[0]->type(), CXDCreateStructureForGroup);
+    EXPECT_EQ(flat[1]->type(), CXDCompositeGroupChange);
+}
+
+TEST(Flattening, APayloadThatCannotBeReadStandsForItself) {
+    const test::LogCapture log(0);
+    const auto damaged = makeRecord(CXDChangeGroupName, nullptr, "G1");
+    damaged->setEncodedPayload(std::make_shared<const Bytes>(Bytes{0xff}));
+    const CXDChangeRecords flat = flattenGroupChanges({damaged, makeRecord(CXDAddRecordToGroup, "P1", "G1")});
+    ASSERT_EQ(flat.size(), 2u);
+    EXPECT_EQ(flat[0]->type(), CXDChangeGroupName);
+    EXPECT_TRUE(log.has("Exception with reading change record: "));
+}
+
+} // namespace
+} // namespace rolvane
