@@ -46,4 +46,11 @@ Dictionary CXMerger::merged(const Dictionary& card, const Dictionary& importedCa
     return result;
 }
 
+void CXMerger::updateCard(CXPerson& card, const CXPerson& importedCard) const {
+    Dictionary own = card.dictionaryRepresentation();
+    Dictionary result = merged(own, importedCard.dictionaryRepresentation());
+    for (const auto& [key, value] : result)
+        if (own[key] != value) card.setValue(value, key);
+}
+
 } // namespace rolvane

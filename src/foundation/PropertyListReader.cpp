@@ -231,7 +231,7 @@ private:
         return std::move(*value);
     }
 
-    // The parser lets some overlong forms pass.
+    // Whatever the parser lets pass: what is read can be written again.
     void checkText() const {
         if (const auto fault = xmlTextFault(_text)) refuse("a text cannot be used: " + *fault);
     }

@@ -6,12 +6,14 @@
 #include "support/ChildProcess.h"
 #include "support/TempHome.h"
 
+#include <cerrno>
 #include <memory>
 #include <optional>
 #include <regex>
 #include <thread>
 
 #include <gtest/gtest.h>
+#include <sys/uio.h>
 #include <unistd.h>
 
 using namespace rolvane;
@@ -27,9 +29,21 @@ struct Described {
     }
 };
 
+// Stands in for the journal: what the sink hands over, and the answer that it gets.
+std::vector<std::string> journalled;
+int journalAnswer = 0;
+
 enum class Kind { first = 1, second = 2 };
 
 } // namespace
+
+// Found before the library's function of that name, since it is in the program.
+extern "C" int sd_journal_sendv(const iovec* fields, int count) {
+    journalled.clear();
+    for (int i = 0; i < count; ++i)
+        journalled.emplace_back(static_cast<const char*>(fields[i].iov_base), fields[i].iov_len);
+    return journalAnswer;
+}
 
 TEST(LogFormat, ObjectPlaceholdersShowDescriptions) {
     EXPECT_EQ(CXFormat("Mingled: %@.", Described{}), "Mingled: described.");
@@ -137,6 +151,19 @@ TEST(LogSinks, AJournalEntryNamesMessagePriorityProgramAndThread) {
     EXPECT_EQ(fields[1], "PRIORITY=5");
     EXPECT_EQ(fields[2], "SYSLOG_IDENTIFIER=RolvaneManager");
     EXPECT_EQ(fields[3], "TID=" + std::to_string(::gettid()));
+}
+
+TEST(LogSinks, TheJournalGetsTheFieldsOfALine) {
+    journalAnswer = 0;
+    JournalSink().write("Entering main run loop.");
+    EXPECT_EQ(journalled, journalFields("Entering main run loop.", program_invocation_short_name));
+}
+
+TEST(LogSinks, ALineThatTheJournalRefusesGoesToStandardError) {
+    journalAnswer = -ENOBUFS;
+    testing::internal::CaptureStderr();
+    JournalSink().write("not lost");
+    EXPECT_NE(testing::internal::GetCapturedStderr().find("]: not lost\n"), std::string::npos);
 }
 
 TEST(LogSinks, AStandardErrorLineCarriesTimeProgramAndProcess) {

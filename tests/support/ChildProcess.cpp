@@ -56,6 +56,25 @@ std::vector<char*> pointers(const std::vector<std::string>& texts) {
     ::_exit(127);
 }
 
+// Writing to a child that has ended is no reason for this process to end.
+class WithoutBrokenPipeSignal {
+public:
+    WithoutBrokenPipeSignal() {
+        sigemptyset(&_pipe);
+        sigaddset(&_pipe, SIGPIPE);
+        pthread_sigmask(SIG_BLOCK, &_pipe, &_former);
+    }
+    ~WithoutBrokenPipeSignal() {
+        timespec now{};
+        while (::sigtimedwait(&_pipe, nullptr, &now) < 0 && errno == EINTR) {
+        }
+        pthread_sigmask(SIG_SETMASK, &_former, nullptr);
+    }
+
+private:
+    sigset_t _pipe, _former;
+};
+
 int milliseconds(double seconds) {
     return static_cast<int>(seconds * 1000) + 1;
 }
@@ -158,6 +177,7 @@ void ChildProcess::closeInput() {
 }
 
 void ChildProcess::writeInput(const std::string& text) {
+    WithoutBrokenPipeSignal guard;
     for (size_t done = 0; done < text.size();) {
         ssize_t n = ::write(_input, text.data() + done, text.size() - done);
         if (n < 0 && errno == EINTR) continue;

@@ -16,11 +16,11 @@ namespace rolvane::test {
 class ChildProcess {
 public:
     struct Options {
-        std::vector<std::string> arguments;                  // the program first; searched in PATH without a slash
-        std::optional<std::vector<std::string>> environment; // "NAME=value"; none: the parent's
-        std::string directory;                               // empty: the parent's
-        std::string input;                                   // what it reads from standard input, then end of file
-        std::vector<std::pair<int, int>> descriptors;        // {parent's, child's}: further ones that it inherits
+        std::vector<std::string> arguments = {};                  // the program first; searched in PATH without a slash
+        std::optional<std::vector<std::string>> environment = {}; // "NAME=value"; none: the parent's
+        std::string directory = {};                               // empty: the parent's
+        std::string input = {};                                   // what it reads from standard input, then end of file
+        std::vector<std::pair<int, int>> descriptors = {};        // {parent's, child's}: further ones that it inherits
     };
     struct Ending {
         int status = 0; // exit status, when it exited
@@ -30,7 +30,7 @@ public:
 
     explicit ChildProcess(Options options); // throws std::runtime_error when it cannot be started
     explicit ChildProcess(std::vector<std::string> arguments)
-        : ChildProcess(Options{std::move(arguments), {}, {}, {}, {}}) {}
+        : ChildProcess(Options{.arguments = std::move(arguments)}) {}
     ~ChildProcess();
     ChildProcess(const ChildProcess&) = delete;
     ChildProcess& operator=(const ChildProcess&) = delete;
