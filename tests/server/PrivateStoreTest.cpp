@@ -495,6 +495,15 @@ TEST(PrivateStore, ARemovedUserIsRefusedAndTheFilesStay) {
     EXPECT_EQ(world.alice().request("PROPFIND", "/alice/", {"Depth: 0"}).status, 207);
 }
 
+TEST(PrivateStore, MakesATreeAnewThatItsUserDeleted) {
+    World world;
+    EXPECT_EQ(world.alice().request("DELETE", "/alice/").status, 204);
+    EXPECT_EQ(world.bob().request("MKCOL", "/alice").status, 403);
+    world.store.stop();
+    world.store.start();
+    EXPECT_EQ(world.alice().request("PUT", "/alice/x", {}, "x").status, 201);
+}
+
 TEST(PrivateStore, RefusesUsersThatCannotBePathsAndEmptyPasswords) {
     const StoreDirectory directory;
     PrivateStore store(optionsIn(directory));
