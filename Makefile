@@ -71,6 +71,7 @@ install:
 	cmake --install build/release --prefix '$(PREFIX)'
 
 deb: build
+	@packaging/setup deb
 	cd build/release && cpack -G DEB
 
 clean:
