@@ -35,6 +35,15 @@ bool noRoom(int code, int systemError) {
     return (code & 0xff) == SQLITE_FULL || systemError == ENOSPC || systemError == EDQUOT || systemError == EFBIG;
 }
 
+// A reader of a read-only file leaves the journal's files read-only beside it. When the file has become writable again,
+// so must they, else the file would seem to be read-only for ever.
+void giveJournalTheRightsOf(const std::string& path) {
+    if (::access(path.c_str(), W_OK) != 0) return;
+    for (const char* suffix : {"-wal", "-shm"})
+        if (std::string journal = path + suffix; exists(journal) && ::access(journal.c_str(), W_OK) != 0)
+            ::chmod(journal.c_str(), 0600);
+}
+
 constexpr const char* kKept = "Nothing was lost: the changes are kept in memory and written with the next attempt.";
 
 // What happened to which file, and what to do: one sentence a kind of failure.
@@ -119,6 +128,7 @@ void PreferencesFile::close() {
 }
 
 void PreferencesFile::open() {
+    giveJournalTheRightsOf(_path);
     int code = sqlite3_open_v2(_path.c_str(), &_db, SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX, nullptr);
     try {
         if (code != SQLITE_OK) fail(code);
