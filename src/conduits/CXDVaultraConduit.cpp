@@ -216,10 +216,13 @@ bool CXDVaultraConduit::makeCompositeGroupChange(CXDChangeRecord& record, int& c
     if (!base || !record.group()) return false;
     const Url location = layout::groupLocation(*base, *record.group());
     const auto state = _world.manager.dictionaryAtURL(location, false, &code);
-    // When the state was there but could not be read, the client refuses the write: it is not the state that was read.
-    const Dictionary changed =
-        layout::groupStateAfterComposite(state.value_or(Dictionary()), record.payload().dictionary());
-    return _world.manager.write(stringForDictionary(changed), location, kSecureRecordWrites, &code);
+    const Dictionary changed = layout::groupStateAfterComposite(state.value_or(Dictionary()), contentOf(record));
+    // A state that is there and could not be read is not replaced by a part of it: the client then sends no write, and
+    // the answer to the read stands.
+    int written = 0;
+    const bool done = _world.manager.write(stringForDictionary(changed), location, kSecureRecordWrites, &written);
+    if (written != 0) code = written;
+    return done;
 }
 
 bool CXDVaultraConduit::changeGroupName(CXDChangeRecord& record, int& code) {

@@ -2,6 +2,8 @@
 
 #include "foundation/PropertyList.h"
 
+#include <algorithm>
+
 using namespace rolvane;
 using namespace rolvane::test;
 
@@ -195,7 +197,7 @@ TEST_F(Capture, AGroupWithoutLocationIsComparedUnderThePublishedDatabasesFirstLo
 
 TEST_F(Capture, AGroupSeenForTheFirstTimeIsAnnouncedInOrderWithItsMembersData) {
     publishAll();
-    const auto a = person("A"), b = person("B");
+    const auto a = person("A", "A"), b = person("B", "B"); // choices come in the order of identifiers
     const auto friends = group("F", {a, b});
     EXPECT_EQ(lines(conduit->changesForGroup(friends)),
               (Texts{"2 <self> - " + uid(friends) + " 4", "6 <self> " + uid(friends) + " AllCXGroup 4",

@@ -5,19 +5,21 @@
 #include "model/RemoteLocationMap.h"
 
 #include <algorithm>
-#include <functional>
+#include <atomic>
+#include <map>
 #include <mutex>
-#include <set>
 #include <string>
+#include <utility>
 #include <vector>
 
 namespace rolvane::test {
 
-// An engine that keeps the conduits' data in memory and writes down what it is asked for. The account's user is "ada".
+// An engine that keeps the conduits' data in memory and writes down what it is asked for. The account's user is "ada"
+// unless a test says otherwise.
 class FakeEngine : public ConduitEngine {
 public:
     UserName userForRemoteLocation(const RemoteLocation& location) const override {
-        const auto user = rolvane::userForRemoteLocation(location, UserName("ada"), "ada");
+        const auto user = rolvane::userForRemoteLocation(location, account, account.str());
         if (!user) note("kill " + location.str());
         return user.value_or(UserName());
     }
@@ -61,10 +63,7 @@ public:
     CXDConduit* conduitForSyncSource(int32_t) override { return nullptr; }
 
     void updateStateAndExitIfNeeded() override { note("updateStateAndExitIfNeeded"); }
-    void checkCXShareCount() override {
-        note("checkCXShareCount");
-        if (duringShareCountCheck) duringShareCountCheck();
-    }
+    void checkCXShareCount() override { note("checkCXShareCount"); }
     void applyChangeRecords(const CXDChangeRecords& records) override {
         note("applyChangeRecords");
         applied = records;
@@ -78,12 +77,12 @@ public:
     }
     Dictionary priorState(const char* conduitID) { return conduitObjectForKey(conduitID, "priorState"); }
 
+    UserName account{"ada"};
     Dictionary data;
     std::vector<RemoteLocation> revoked;
     std::map<UniqueId, RemoteLocation> subscriptionMap;
     std::optional<UserName> canceledUser;
     std::map<UniqueId, int32_t> sources;
-    std::function<void()> duringShareCountCheck;
     CXDChangeRecords applied;
     std::atomic<bool> locks = true;
 
