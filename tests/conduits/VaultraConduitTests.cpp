@@ -432,8 +432,8 @@ TEST_F(VaultraConduit, RecordsWithoutWhatTheyNameFailAndSendNothing) {
 
 TEST_F(VaultraConduit, ChangesThatTheStoreHasNoPlaceForFail) {
     open();
-    for (int type : {0, CXDAddGroupToGroup, CXDUpdateDistributionList, CXDRemoveDistributionListFromGroup,
-                     CXDRemoveGroupFromGroup, 42}) {
+    for (int type : std::initializer_list<int>{0, CXDAddGroupToGroup, CXDUpdateDistributionList,
+                                               CXDRemoveDistributionListFromGroup, CXDRemoveGroupFromGroup, 42}) {
         EXPECT_FALSE(apply(record(type, "P", "G:CXGroup", Dictionary()))) << type;
         EXPECT_FALSE(denied) << type;
     }
