@@ -57,15 +57,19 @@ void ApplyLoop::run(CXDChangeRecords records, bool trickle, bool allowRetry) {
     cleanUp();
     if (foreign) std::rethrow_exception(foreign);
 
+    std::exception_ptr notStored;
     try {
         storeAndClose(allowRetry);
     } catch (const CXException& e) {
         CXLog("applyChangeRecords close: Caught %@: %@", e.name(), e.reason());
+        if (trickle && !_queueStored) notStored = std::current_exception();
     }
     _parts.revoked.clear();
     bumpShareCount();
     _parts.with.progress.stop();
     _actions.persist();
+    // Whoever handed the changes over still has them, and must not take them for done. A full pass finds its own again.
+    if (notStored) std::rethrow_exception(notStored);
 }
 
 void ApplyLoop::applyAll(bool trickle) {
@@ -184,6 +188,7 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
     CXDLog("Pending: %@", _pendingChanges);
     CXDLog("Denied:  %@", _parts.denied.all());
     _parts.state.setPendingChanges(_pendingChanges);
+    _queueStored = true;
     _pendingChanges.clear();
     if (!_parts.denied.empty()) {
         _parts.denied.clear();
@@ -197,10 +202,14 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
 void ApplyLoop::bumpShareCount() {
     const std::optional<UserName> user = _parts.with.account.vaultraUser();
     Preferences& preferences = _parts.with.preferences;
-    preferences.set(kDaemonDomain, kCXDLastOstrelUser, user ? Value(*user) : Value());
-    _parts.state.putConduitData();
-    _parts.with.rolvane.bumpShareCount(preferences);
-    preferences.synchronize(kDaemonDomain);
+    try {
+        preferences.set(kDaemonDomain, kCXDLastOstrelUser, user ? Value(*user) : Value());
+        _parts.state.putConduitData();
+        _parts.with.rolvane.bumpShareCount(preferences);
+        preferences.synchronize(kDaemonDomain);
+    } catch (const CXException& e) {
+        CXLog("applyChangeRecords: Caught %@: %@", e.name(), e.reason());
+    }
 }
 
 } // namespace rolvane

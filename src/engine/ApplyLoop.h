@@ -27,7 +27,8 @@ public:
     ApplyLoop(EngineParts& parts, Actions actions);
     ~ApplyLoop();
 
-    // applyChangeRecords:trickle:allowRetry:
+    // applyChangeRecords:trickle:allowRetry:. Exceptions of the base class are logged and end nothing, but for one: a
+    // trickle pass whose queue could not be stored throws at its end, so that the changes are delivered again.
     void run(CXDChangeRecords records, bool trickle, bool allowRetry);
 
 private:
@@ -48,6 +49,7 @@ private:
     Actions _actions;
     CXDChangeRecords _unhandled; // what an exception would leave behind: the input, then the flat list
     bool _queueTaken = false;    // the stored queue is part of the pass
+    bool _queueStored = false;
     CXDChangeRecords _pendingChanges;
     CXDChangeRecords _inOrder;
     size_t _inOrderDone = 0;

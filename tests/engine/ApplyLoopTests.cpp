@@ -1,5 +1,7 @@
 #include "EngineWorld.h"
 
+#include "Writes.h"
+#include "engine/EngineState.h"
 #include "foundation/CXException.h"
 #include "support/CapturingLog.h"
 
@@ -255,6 +257,27 @@ TEST_F(Pass, ACountThatACrashLeftHalfBumpedIsCompletedNotThrownAway) {
     world.engine->checkCXShareCount();
     EXPECT_EQ(world.rolvane->shareCount(), count + 1);
     EXPECT_EQ(world.pending(), Strings{"P1:4"});
+}
+
+TEST_F(Pass, AFullDiskLeavesTheChangesWithWhoeverDeliveredThem) {
+    trickle({});
+    world.engine->setPendingChanges({update("P1", 2)});
+    test::CapturingLog log;
+    world.vaultra->whenApplying = [](const CXDChangeRecordPtr&, bool*) {
+        test::interceptWrites([] { return false; });
+        return false;
+    };
+    EXPECT_THROW(trickle({update("P2")}), CXException);
+    test::interceptWrites(nullptr);
+    EXPECT_TRUE(log.mentions("applyChangeRecords close: Caught CXPreferencesException: ")) << log.text();
+    EXPECT_EQ(world.events.all().back(), "stop") << "the pass goes to its end all the same";
+    Preferences onDisk(world.preferences.path());
+    EXPECT_EQ(EngineState(onDisk).getPendingChanges().size(), 1u);
+    EXPECT_EQ(onDisk.get(kDaemonDomain, "CXDShareCount").integer(), world.rolvane->shareCount());
+
+    world.vaultra->whenApplying = nullptr;
+    trickle({update("P2")});
+    EXPECT_EQ(world.pending(), Strings{"P1:2"});
 }
 
 // -- denials

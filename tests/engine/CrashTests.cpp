@@ -1,9 +1,10 @@
 #include "EngineWorld.h"
+#include "Writes.h"
 
+#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <gtest/gtest.h>
-#include <sqlite3.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -15,48 +16,25 @@ using test::makeRecord;
 using test::update;
 using test::World;
 
-// Ends the process, as a kill does, before the given write of a database or preferences file.
+// Ends the process, as a kill does, before the given write: of a database or preferences file, or to the store.
 class KillBeforeWrite {
 public:
+    static constexpr int kKilled = 9;
     explicit KillBeforeWrite(int write) {
         left = write;
-        sqlite3_vfs* vfs = sqlite3_vfs_find(nullptr);
-        const auto replace = [&](const char* name, sqlite3_syscall_ptr with) {
-            if (vfs->xGetSystemCall(vfs, name)) vfs->xSetSystemCall(vfs, name, with);
-        };
-        replace("write", reinterpret_cast<sqlite3_syscall_ptr>(countedWrite));
-        replace("pwrite", reinterpret_cast<sqlite3_syscall_ptr>(countedPwrite));
-        replace("pwrite64", reinterpret_cast<sqlite3_syscall_ptr>(countedPwrite));
-        replace("ftruncate", reinterpret_cast<sqlite3_syscall_ptr>(countedTruncate));
-        replace("unlink", reinterpret_cast<sqlite3_syscall_ptr>(countedUnlink));
+        test::interceptWrites([] {
+            step();
+            return true;
+        });
+    }
+    static void step() {
+        if (left-- == 0) ::_exit(kKilled);
     }
 
 private:
-    static int left;
-    static void count() {
-        if (left-- == 0) ::_exit(kKilled);
-    }
-    static ssize_t countedWrite(int fd, const void* bytes, size_t size) {
-        count();
-        return ::write(fd, bytes, size);
-    }
-    static ssize_t countedPwrite(int fd, const void* bytes, size_t size, off_t at) {
-        count();
-        return ::pwrite(fd, bytes, size, at);
-    }
-    static int countedTruncate(int fd, off_t size) {
-        count();
-        return ::ftruncate(fd, size);
-    }
-    static int countedUnlink(const char* path) {
-        count();
-        return ::unlink(path);
-    }
-
-public:
-    static constexpr int kKilled = 9;
+    static std::atomic<int> left;
 };
-int KillBeforeWrite::left = 0;
+std::atomic<int> KillBeforeWrite::left = -1; // never
 
 const std::vector<std::string> kPeople{"P1:CXPerson", "P2:CXPerson", "P3:CXPerson"};
 constexpr const char* kGroup = "G1:CXGroup";
@@ -69,6 +47,12 @@ public:
         fs::create_directories(store);
         world.prepare = [this] { connect(); };
         world.start();
+        deliveries = world.center.observe(kCXDatabaseChangedExternallyNotificationPriv, [this](const Notification& n) {
+            CXDChangeRecords found;
+            for (const Value& person : n.userInfo[kCXInsertedRecords].array())
+                found.push_back(update(person.string().c_str()));
+            world.engine->applyChangeRecords(found);
+        });
     }
     void pass() { world.engine->bringSourcesUpToDate(); }
 
@@ -76,7 +60,7 @@ public:
         std::set<std::string> names;
         for (const auto& entry : fs::directory_iterator(store)) {
             std::string name = entry.path().filename();
-            if (name.starts_with("P")) names.insert(name);
+            if (name.ends_with(":CXPerson")) names.insert(name);
         }
         return names;
     }
@@ -94,6 +78,8 @@ public:
 
     World world;
     const std::string store;
+
+    ObservationHandle deliveries;
 
 private:
     std::set<std::string> linesOf(const std::string& file) const {
@@ -125,20 +111,44 @@ private:
         };
         world.vaultra->whenApplying = [this](const CXDChangeRecordPtr& record, bool*) {
             const std::lock_guard guard(lock);
+            KillBeforeWrite::step();
             std::ofstream(store + "/log", std::ios::app) << record->type() << "\n";
             if (record->person()) std::ofstream(store + "/" + record->person()->str()) << "here";
             std::set<std::string> now = linesOf("members");
             for (const Value& v : record->inMemoryPayload().dictionary()["memberAdds"].array()) now.insert(v.string());
             std::ofstream out(store + "/members");
             for (const std::string& line : now) out << line << "\n";
+            out.close();
+            KillBeforeWrite::step();
             return true;
         };
     }
     std::mutex lock;
 };
 
+// Temporary directories lie in memory while it lives, where there is such a place: a kill loses nothing of a page
+// cache, so what a disk adds is only waiting.
+class InMemory {
+public:
+    InMemory() {
+        if (const char* set = std::getenv("TMPDIR")) former = set;
+        if (::access("/dev/shm", W_OK) == 0) ::setenv("TMPDIR", "/dev/shm", 1);
+    }
+    ~InMemory() {
+        if (former)
+            ::setenv("TMPDIR", former->c_str(), 1);
+        else
+            ::unsetenv("TMPDIR");
+    }
+
+private:
+    std::optional<std::string> former;
+};
+
 class Crash : public ::testing::Test {
 protected:
+    InMemory memory; // first: the directory lies there
+    test::TempDirectory before;
     // A daemon that has run before: its database and its preferences know each other, and one change is queued that
     // nobody could find again.
     void SetUp() override {
@@ -158,12 +168,12 @@ protected:
         return root;
     }
     // True when the pass ended before it came to that write.
-    bool passKilledBefore(int write, const std::string& root) {
+    bool killedBefore(int write, const std::string& root, void (*action)(Daemon&)) {
         const pid_t child = ::fork();
         if (child == 0) {
             Daemon daemon(root);
             const KillBeforeWrite kill(write);
-            daemon.pass();
+            action(daemon);
             ::_exit(0);
         }
         int status = 0;
@@ -172,7 +182,6 @@ protected:
         EXPECT_TRUE(WEXITSTATUS(status) == 0 || WEXITSTATUS(status) == KillBeforeWrite::kKilled) << WEXITSTATUS(status);
         return WEXITSTATUS(status) == 0;
     }
-    test::TempDirectory before;
 };
 
 TEST_F(Crash, BeforeAnyWriteOfAPassLosesNothingAndDoublesNothing) {
@@ -180,7 +189,7 @@ TEST_F(Crash, BeforeAnyWriteOfAPassLosesNothingAndDoublesNothing) {
     int write = 0;
     for (bool ended = false; !ended; ++write) {
         const std::string root = freshCopy(write);
-        ended = passKilledBefore(write, root);
+        ended = killedBefore(write, root, [](Daemon& daemon) { daemon.pass(); });
 
         Daemon daemon(root);
         daemon.pass();
@@ -200,6 +209,41 @@ TEST_F(Crash, BeforeAnyWriteOfAPassLosesNothingAndDoublesNothing) {
         fs::remove_all(root);
     }
     EXPECT_GT(write, 10) << "the pass has far more writes than were killed";
+}
+
+TEST_F(Crash, BeforeAnyWriteOfADeliveryLosesNoOtherProcesssEdit) {
+    {
+        Daemon watching(before / "daemon");
+        watching.world.engine->setPendingChanges({});
+        watching.pass();
+        watching.world.rolvane->cursorPosition(); // watched from here on
+    }
+    std::string saved;
+    {
+        World application(true, before / "daemon");
+        const auto other = application.application();
+        const auto person = CXPerson::create();
+        other->addRecord(person);
+        other->save();
+        saved = person->uniqueId().str();
+    }
+    int write = 0;
+    for (bool ended = false; !ended; ++write) {
+        const std::string root = freshCopy(write);
+        ended = killedBefore(write, root, [](Daemon& daemon) { daemon.world.rolvane->deliverExternalChanges(); });
+
+        SCOPED_TRACE("killed before write " + std::to_string(write));
+        Daemon daemon(root);
+        daemon.pass();
+        daemon.world.rolvane->deliverExternalChanges();
+        EXPECT_TRUE(daemon.people().count(saved));
+        EXPECT_TRUE(daemon.world.pending().empty());
+        EXPECT_FALSE(daemon.world.rolvane->deliverExternalChanges());
+        for (const char* conduit : {"CXDCX", "CXDVaultra"}) EXPECT_EQ(daemon.stateOf(conduit), kPeople) << conduit;
+        if (HasFailure()) break;
+        fs::remove_all(root);
+    }
+    EXPECT_GT(write, 10);
 }
 
 } // namespace

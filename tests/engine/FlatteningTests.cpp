@@ -2,6 +2,8 @@
 
 #include "Records.h"
 
+#include <algorithm>
+#include <chrono>
 #include <gtest/gtest.h>
 #include <rapidcheck/gtest.h>
 
@@ -130,6 +132,21 @@ TEST(Flattening, APayloadThatCannotBeReadStandsForItself) {
     ASSERT_EQ(flat.size(), 2u);
     EXPECT_EQ(flat[0]->type(), CXDChangeGroupName);
     EXPECT_TRUE(log.has("Exception with reading change record: "));
+}
+
+// Compared with itself at a tenth of the size; a walk for each change would cost a hundred times as much.
+TEST(Flattening, OneLargeGroupCostsInProportionToItsChanges) {
+    const auto seconds = [](size_t members) {
+        CXDChangeRecords records;
+        for (size_t i = 0; i < members; ++i)
+            records.push_back(makeRecord(CXDAddRecordToGroup, ("P" + std::to_string(i)).c_str(), "G1"));
+        const auto start = std::chrono::steady_clock::now();
+        const CXDChangeRecords flat = flattenGroupChanges(records);
+        EXPECT_EQ(flat.size(), 1u);
+        return std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
+    };
+    const double small = std::max(seconds(2000), 1e-4);
+    EXPECT_LT(seconds(20000), 40 * small);
 }
 
 } // namespace
