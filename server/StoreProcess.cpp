@@ -65,7 +65,7 @@ bool becomeIdentity(const StoreIdentity& identity) {
     dup2(null, 0);
     dup2(output, 1);
     dup2(output, 2);
-    if (report != 3) dup2(report, 3);
+    dup2(report, 3);
     close_range(4, ~0u, 0);
     fcntl(3, F_SETFD, FD_CLOEXEC);
     if (becomeIdentity(identity) && chdir("/") == 0) execv(arguments[0], arguments);
@@ -165,6 +165,9 @@ StoreProcess StoreProcess::launch(const std::vector<std::string>& command, const
     int ends[2];
     if (pipe2(ends, O_CLOEXEC) != 0) fail(std::string("The store cannot be started: ") + std::strerror(errno) + ".");
     FileHandle reading(ends[0]), writing(ends[1]);
+    // Out of the way of the child's standard descriptors, whatever of them this process has closed.
+    output = FileHandle(fcntl(output.get(), F_DUPFD_CLOEXEC, 10));
+    writing = FileHandle(fcntl(writing.get(), F_DUPFD_CLOEXEC, 10));
 
     std::vector<char*> arguments;
     for (const auto& argument : command) arguments.push_back(const_cast<char*>(argument.c_str()));

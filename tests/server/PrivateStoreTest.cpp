@@ -554,6 +554,26 @@ TEST(PrivateStore, RunsForAnOrdinaryUser) {
     EXPECT_EQ(status, 0);
 }
 
+TEST(PrivateStore, StartsFromAProgramWithoutStandardDescriptors) {
+    const StoreDirectory directory;
+    const pid_t child = fork();
+    if (child == 0) {
+        for (int fd : {0, 1, 2}) close(fd);
+        int result = 1;
+        try {
+            PrivateStore store(optionsIn(directory));
+            store.start();
+            result = store.status().running ? 0 : 2;
+        } catch (const CXException&) {
+            result = 3;
+        }
+        _exit(result);
+    }
+    int status = 0;
+    waitpid(child, &status, 0);
+    EXPECT_EQ(status, 0);
+}
+
 TEST(PrivateStore, NeverServesAsRoot) {
     const World world;
     struct stat info {};
