@@ -219,6 +219,7 @@ bool PrivateStore::Implementation::tryStart(int port, const StoreIdentity& ident
     } catch (const CXException&) {
         process.signal(SIGKILL);
         process.waitForExit(5s);
+        endOrphans();
         if (mayMove && !LoopbackPort::isFree(port)) return false;
         throw;
     }
