@@ -111,7 +111,8 @@ public:
     // The unit of work -----------------------------------------------------------------------------------------------
     // Writes all unsaved changes in one transaction with one journal entry a record, then tells the other processes.
     // Nothing unsaved: nothing happens. An update of a record that another process has removed meanwhile is dropped;
-    // other processes' changes to other properties of the same record are kept. True always; throws on failure.
+    // other processes' changes to other properties of the same record are kept. Of two processes that subscribe to one
+    // location at a time, the first one's subscription stays. True always; throws on failure.
     bool save();
     bool hasUnsavedChanges() const;
     void rollback(); // drops the unsaved changes; handles of records that were only added become empty

@@ -63,6 +63,7 @@ private:
     void writeRecord(const UniqueId& uid, const PendingRecord& record) {
         std::optional<StoredRow> row = _store.row(uid);
         if (!row && record.isInsertion()) {
+            if (isSubscribedMeanwhile(record)) return;
             _store.insertRow(uid, record.kind, record.over({}), _date, _date);
             if (!isAllKind(record.kind)) note(uid, CXChangeKind::inserted);
             return;
@@ -72,6 +73,12 @@ private:
             return;
         }
         if (record.changesProperties()) updateRow(uid, record, *row);
+    }
+
+    // Two processes that subscribe to one location at a time: the first one's subscription serves both.
+    bool isSubscribedMeanwhile(const PendingRecord& record) {
+        bool once = record.kind == RecordKind::subscription || record.kind == RecordKind::allSubscribedGroup;
+        return once && _store.firstOfLocation(record.kind, record.location).has_value();
     }
 
     void updateRow(const UniqueId& uid, const PendingRecord& record, const StoredRow& row) {

@@ -1,7 +1,7 @@
 // What the daemon needs beyond records: the share count and other processes' saves.
 
 #include "contacts/RolvaneImpl.h"
-#include "foundation/Preferences.h"
+#include "contacts/ShareCountBump.h"
 
 #include <unistd.h>
 
@@ -9,9 +9,7 @@ namespace rolvane {
 
 namespace {
 
-constexpr const char* kShareCountKey = "CXDShareCount";
-constexpr const char* kIntentKey = "CXDShareCountIntent"; // {count, identity, token of the latest save}
-constexpr int64_t kOwnEntriesKept = 1000;                 // entries of our own that the cursor may leave behind itself
+constexpr int64_t kOwnEntriesKept = 1000; // entries of our own that the cursor may leave behind itself
 
 } // namespace
 
@@ -29,37 +27,16 @@ void CXRolvane::setShareCount(int64_t count) {
 
 int64_t CXRolvane::bumpShareCount(Preferences& preferences) {
     std::lock_guard lock(_impl->mutex);
-    save(); // the token below must be of a history that the new count continues
-    int64_t count = shareCount() + 1;
-    preferences.set(kDaemonDomain, kShareCountKey, count);
-    preferences.set(
-        kDaemonDomain, kIntentKey,
-        Dictionary{{"count", count}, {"identity", _impl->identity}, {"token", _impl->journal.latestToken()}});
-    preferences.synchronize(kDaemonDomain);
-    setShareCount(count);
-    save();
-    preferences.remove(kDaemonDomain, kIntentKey);
-    preferences.synchronize(kDaemonDomain);
+    ShareCountBump bump(*this, preferences);
+    int64_t count = bump.writeIntent();
+    bump.writeDatabase(count);
+    bump.clearIntent();
     return count;
 }
 
 void CXRolvane::recoverShareCount(Preferences& preferences) {
     std::lock_guard lock(_impl->mutex);
-    Value intent = preferences.get(kDaemonDomain, kIntentKey);
-    if (intent.isAbsent()) return;
-    Dictionary meant = intent.dictionary();
-    int64_t count = meant["count"].integer();
-    const std::string& token = meant["token"].string();
-    // Only the very database whose bump was interrupted, or one that has gone on from there, is completed: a copy of
-    // an earlier state lacks the save that the intent names.
-    bool sameDatabase = meant["identity"].string() == _impl->identity;
-    bool sameHistory = token.empty() || _impl->journal.hasToken(token);
-    if (sameDatabase && sameHistory && shareCount() == count - 1) {
-        setShareCount(count);
-        save();
-    }
-    preferences.remove(kDaemonDomain, kIntentKey);
-    preferences.synchronize(kDaemonDomain);
+    ShareCountBump(*this, preferences).recover();
 }
 
 // Other processes' saves ---------------------------------------------------------------------------------------------
