@@ -1,7 +1,5 @@
 #include "contacts/Sqlite.h"
 
-#include <cerrno>
-#include <cstring>
 #include <fcntl.h>
 #include <sqlite3.h>
 #include <sys/stat.h>
@@ -11,15 +9,12 @@ namespace rolvane {
 
 namespace {
 
-bool isNoRoom(int code, int systemError) {
-    if (code == SQLITE_FULL) return true;
-    return code == SQLITE_IOERR && (systemError == ENOSPC || systemError == EDQUOT || systemError == EFBIG);
-}
-
-std::string explanation(int code, int systemError, const std::string& detail) {
-    if (isNoRoom(code, systemError))
-        return "there is no room left on its disk. Nothing stored was lost; free some space and try again.";
-    switch (code) {
+std::string explanation(int extendedCode, const std::string& detail) {
+    if (extendedCode == SQLITE_IOERR_WRITE) // a quota or a limit on file sizes looks like this
+        return "no room is left for it on its disk, or the disk is failing. Nothing stored was lost; free some space "
+               "and try again.";
+    switch (extendedCode & 0xff) {
+    case SQLITE_FULL: return "no room is left on its disk. Nothing stored was lost; free some space and try again.";
     case SQLITE_BUSY:
     case SQLITE_LOCKED:
         return "another program has kept it locked for too long. Nothing was lost; try again in a moment.";
@@ -33,10 +28,7 @@ std::string explanation(int code, int systemError, const std::string& detail) {
     case SQLITE_NOTADB:
         return "the file is damaged (" + detail +
                "). It was left as it is; move it away and put a backup in its place.";
-    case SQLITE_IOERR:
-        return std::string("its disk reports an error (") + detail +
-               (systemError ? std::string(", ") + std::strerror(systemError) : std::string()) +
-               "). Check the disk, then try again.";
+    case SQLITE_IOERR: return "its disk reports an error (" + detail + "). Check the disk, then try again.";
     default: return detail + ". This is unexpected; please report it.";
     }
 }
@@ -52,10 +44,9 @@ void makePrivateFile(const std::string& path) {
 } // namespace
 
 void throwSqliteError(sqlite3* handle, int code, const std::string& path, std::string_view doing) {
-    int systemError = handle ? sqlite3_system_errno(handle) : 0;
     std::string detail = handle ? sqlite3_errmsg(handle) : sqlite3_errstr(code);
     throw CXException(kCXDatabaseException, "Could not " + std::string(doing) + " the contact database " + path + ": " +
-                                                explanation(code & 0xff, systemError, detail));
+                                                explanation(code, detail));
 }
 
 struct Sqlite::Prepared {
@@ -129,8 +120,8 @@ void Sqlite::Statement::reset() {
 
 void Sqlite::Statement::check(int code) const {
     if (code == SQLITE_OK) return;
-    bool reading = sqlite3_stmt_readonly(_prepared->statement) != 0;
-    throwSqliteError(_database._handle, code, _database._path, reading ? "read" : "write to");
+    bool writing = _database._writing || !sqlite3_stmt_readonly(_prepared->statement);
+    throwSqliteError(_database._handle, code, _database._path, writing ? "write to" : "read");
 }
 
 Sqlite::Statement& Sqlite::Statement::bind(int index, int64_t value) {
@@ -188,10 +179,17 @@ bool Sqlite::Statement::isNull(int column) const {
 }
 
 SqliteTransaction::SqliteTransaction(Sqlite& database) : _database(database) {
-    _database.statement("BEGIN IMMEDIATE").run();
+    _database._writing = true;
+    try {
+        _database.statement("BEGIN IMMEDIATE").run();
+    } catch (...) {
+        _database._writing = false;
+        throw;
+    }
 }
 
 SqliteTransaction::~SqliteTransaction() {
+    _database._writing = false;
     if (!_open) return;
     try {
         _database.statement("ROLLBACK").run();

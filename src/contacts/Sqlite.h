@@ -66,10 +66,12 @@ public:
 
 private:
     friend class Statement;
+    friend class SqliteTransaction;
     std::shared_ptr<Prepared> prepare(std::string_view sql);
 
     std::string _path;
     sqlite3* _handle = nullptr;
+    bool _writing = false; // a write transaction is open: what fails now is the writing
     std::map<std::string, std::shared_ptr<Prepared>, std::less<>> _prepared;
 };
 

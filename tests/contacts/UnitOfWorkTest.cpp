@@ -144,8 +144,8 @@ struct InMemory {
 RC_GTEST_PROP(UnitOfWork, QueriesTellTheSameBeforeAndAfterTheSave, ()) {
     InMemory memory;
     TestDatabase d;
-    for (int round = 0; round < 3; round++) {
-        int changes = *rc::gen::inRange(1, 30);
+    for (int round = 0; round < 2; round++) {
+        int changes = *rc::gen::inRange(1, 25);
         for (int i = 0; i < changes; i++) change(*d);
         std::string before = everything(*d);
         d->save();
@@ -171,7 +171,7 @@ RC_GTEST_PROP(UnitOfWork, TwoProcessesThatSaveInTurnSeeTheSameInTheEnd, ()) {
     TestDatabase d;
     CapturingLog quiet;
     auto app = d.open("rolvane");
-    for (int round = 0; round < 3; round++) {
+    for (int round = 0; round < 2; round++) {
         for (int i = 0; i < 12; i++) {
             change(*d);
             change(*app);
