@@ -9,8 +9,10 @@
 namespace rolvane {
 namespace {
 
-// From so many new members on, a group's members are read together instead of one by one.
-constexpr size_t kReadTogether = 16;
+// New members are read together with the others of their group unless they are very few or a small part of it: one row
+// among many costs far less than a lookup, but not nothing.
+constexpr size_t kFew = 4;
+constexpr size_t kRowsPerLookup = 16;
 
 UniqueId sharedPerson(const UniqueId& uid) {
     return cxUIDWithTableName(cxNormalizedUID(uid), kCXPersonTable);
@@ -140,12 +142,18 @@ void ChangeCapture::addMember(const UniqueId& member) {
     addPerson(_reader.personForUniqueId(member), true);
 }
 
-// Many new members: their data is read in a few queries, so that announcing them later finds it here.
+// Many new members: the data of those that are not captured yet is read together, so that announcing them finds it
+// here.
 void ChangeCapture::readNewMembers(const GroupSteps& steps, const CXGroup& group) {
     std::unordered_set<UniqueId> wanted;
     for (const GroupStep& step : steps)
         if (const auto* member = std::get_if<CaptureMember>(&step)) wanted.insert(member->person);
-    if (wanted.size() < kReadTogether) return;
+    if (wanted.size() < kFew) return;
+    _reader.learnSubscribedPeople();
+    std::erase_if(wanted, [this](const UniqueId& member) {
+        return _people.contains(_reader.knownPersonFor(member).value_or(member));
+    });
+    if (wanted.size() < kFew || wanted.size() * kRowsPerLookup < group.memberCount()) return;
     _reader.expectMany();
     _reader.forEachMember(group, wanted, [this](const CXRow& row) { captured(row); });
 }

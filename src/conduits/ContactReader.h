@@ -30,6 +30,8 @@ public:
     CXRecordRef recordForUniqueId(const UniqueId& uid) const;
     // The row of the person that recordForUniqueId finds, read without making an object.
     std::optional<CXRow> personForUniqueId(const UniqueId& uid) const;
+    // One query, after which the next operation always knows.
+    void learnSubscribedPeople() { subscribedPeople(); }
     // The `uniqueId` of that person, where it is known without asking the database; the person may be gone.
     std::optional<UniqueId> knownPersonFor(const UniqueId& uid) const;
     // The same for many members of one group in a few queries: calls for each member of the group that is in `wanted`

@@ -20,6 +20,9 @@ public:
         const auto pick = [&](size_t n) { return std::uniform_int_distribution<size_t>(0, n - 1)(random); };
         const auto anyPerson = [&]() -> CXPersonRef { return people.empty() ? nullptr : people[pick(people.size())]; };
         const auto anyGroup = [&]() -> CXGroupRef { return groups.empty() ? nullptr : groups[pick(groups.size())]; };
+        // Small databases: what goes wrong goes wrong with few records, and the literal version is slow.
+        if (people.size() > 7) return erase(true, pick(100));
+        if (groups.size() > 4) return erase(false, pick(100));
         switch (pick(14)) {
         case 0: people.push_back(person(name(pick(99)).c_str())); break;
         case 1: people.push_back(subscribedPerson("S", ("S" + std::to_string(pick(5))).c_str())); break;
@@ -100,7 +103,7 @@ TEST_F(CaptureOracle, ScansWhatTheRecordByRecordVersionFindsInRandomDatabases) {
     size_t found = 0;
     const bool agreed = rc::check([&](unsigned seed) {
         std::mt19937 random(seed);
-        for (int i = 0; i < 12; ++i) step(random);
+        for (int i = 0; i < 10; ++i) step(random);
         save();
         const Date since = clock.now().addingSeconds(-static_cast<double>(random() % 60));
         preferences.set(kDaemonDomain, CXDCXConduit::kLastSyncDateKey, since);
@@ -112,7 +115,7 @@ TEST_F(CaptureOracle, ScansWhatTheRecordByRecordVersionFindsInRandomDatabases) {
         RC_ASSERT(scanned == expected);
     });
     EXPECT_TRUE(agreed);
-    EXPECT_GT(found, 1000u) << "the databases were nearly empty: nothing was compared";
+    EXPECT_GT(found, 500u) << "the databases were nearly empty: nothing was compared";
 }
 
 TEST_F(CaptureOracle, CapturesOnePersonOrGroupAsTheRecordByRecordVersionDoes) {
