@@ -128,7 +128,7 @@ private:
     bool takeUID(const VCardLine& line) {
         std::string uid(vcardTrim(vcardUnescape(line.value)));
         if (uid.empty()) return true;
-        if (!_entity.uid.empty()) return keep(line), true;
+        if (!_entity.uid.empty()) return true; // a card has one, and the first is it
         _entity.uid = uid;
         if (!line.parameters.empty() || uid != vcardUIDForUUID(vcardUUIDForUID(uid))) keep(line);
         return true;

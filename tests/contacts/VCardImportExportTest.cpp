@@ -409,6 +409,55 @@ TEST(VCardDemo, TheDemonstrationsFileGoesInWithoutAnError) {
     EXPECT_EQ(VCardImport::importFile(*db, kDemo + "people.vcf").unchanged, 318u);
 }
 
+TEST(VCardDemo, ASampleOfTheDemonstrationsPeopleIsRightFieldByField) {
+    TestDatabase db;
+    VCardImport::importFile(*db, kDemo + "people.vcf");
+    auto values = [&](const std::string& id, const char* property) {
+        std::string out;
+        auto multi = personAt(*db, id)->multiValueForProperty(property);
+        for (size_t i = 0; multi && i < multi->count(); i++)
+            out += multi->labelAtIndex(i) + "=" + multi->valueAtIndex(i).string() + " ";
+        return out;
+    };
+    auto text = [&](const std::string& id, const char* property) {
+        return personAt(*db, id)->valueForProperty(property).string();
+    };
+    const std::string ada = "450575F3-F345-4A49-9A86-430AF82B08EA"; // of vCard 3.0
+    EXPECT_EQ(text(ada, kCXFirstNameProperty), "Ada");
+    EXPECT_EQ(text(ada, kCXLastNameProperty), "Thornbury");
+    EXPECT_EQ(text(ada, kCXFormattedNameProperty), "");
+    EXPECT_EQ(text(ada, kCXOrganizationProperty), "Nordlys Værft");
+    EXPECT_EQ(text(ada, kCXDepartmentProperty), "Sveising");
+    EXPECT_EQ(values(ada, kCXEmailProperty),
+              "Work=en0.a@example.org Work=en0.b@example.org Work=en0.c@mail.test Work=en0.d@example.net ");
+    auto addresses = *personAt(*db, ada)->multiValueForProperty(kCXAddressProperty);
+    ASSERT_EQ(addresses.count(), 2u);
+    EXPECT_EQ(addresses.valueAtIndex(1).dictionary()[kCXAddressStreetKey].string(), "Mill Lane 40\nRear entrance");
+    EXPECT_EQ(addresses.valueAtIndex(1).dictionary()[kCXAddressCityKey].string(), "小川町北");
+    EXPECT_EQ(personAt(*db, ada)->valueForProperty(kCXBirthdayProperty).date()->toISO8601(), "2001-06-09T00:00:00Z");
+
+    const std::string orla = "8DB4BEB8-02B3-4348-A215-6870D7757EF5"; // of vCard 4.0
+    EXPECT_EQ(text(orla, kCXOrganizationProperty), "Kestrel & Moss, Ltd.");
+    EXPECT_EQ(text(orla, kCXJobTitleProperty), "Προγραμματίστρια");
+    EXPECT_EQ(values(orla, kCXEmailProperty), "別荘=en1.a@example.com ");
+    EXPECT_EQ(values(orla, kCXPhoneProperty), "Mobile=+46-70-174-06-69 ");
+    EXPECT_EQ(values(orla, kCXRelatedNamesProperty), "Child=Ødis ");
+    auto dates = *personAt(*db, orla)->multiValueForProperty(kCXOtherDatesProperty);
+    EXPECT_EQ(dates.labelAtIndex(0), kCXAnniversaryLabel);
+    EXPECT_EQ(dates.valueAtIndex(0).date()->toISO8601(), "1991-08-21T00:00:00Z");
+
+    const std::string harbour = "8AC6C7E0-47C7-48CE-81BC-A407FA7A9C0C"; // a company
+    EXPECT_TRUE(personAt(*db, harbour)->valueForProperty(kCXIsCompanyProperty).boolean());
+    EXPECT_EQ(text(harbour, kCXOrganizationProperty), "ООО «Тихая гавань»");
+    EXPECT_EQ(values(harbour, kCXPhoneProperty), "WorkFax=+1 202 555 0152 Work=+61 2 5550 0553 ");
+
+    const std::string sakura = "3C868099-F77D-4403-96F3-A25C8D5BEE8A";
+    EXPECT_EQ(text(sakura, kCXFormattedNameProperty), "森崎さくら");
+    EXPECT_EQ(text(sakura, kCXLastNamePhoneticProperty), "わたぬき");
+    EXPECT_EQ(values(sakura, kCXEmailProperty),
+              "Other=ja111.a@mail.test Other=ja111.b@mail.test =ja111.c@example.org ");
+}
+
 TEST(VCardDemo, TheDemonstrationsPeopleAreVaried) {
     TestDatabase db;
     VCardImport::importFile(*db, kDemo + "people.vcf");
