@@ -48,7 +48,7 @@ std::string_view trimmed(std::string_view text) {
 
 } // namespace
 
-CurlSlot::CurlSlot(const CurlTransportOptions& options) : _easy(curl_easy_init()) {
+CurlSlot::CurlSlot(const CurlTransportOptions& options) : _easy(curl_easy_init()), _offersHttp2(options.http2) {
     if (!_easy) throw std::bad_alloc();
     curl_easy_setopt(_easy, CURLOPT_PRIVATE, this);
     curl_easy_setopt(_easy, CURLOPT_HEADERFUNCTION, &CurlSlot::onHeader);
@@ -73,9 +73,8 @@ CurlSlot::CurlSlot(const CurlTransportOptions& options) : _easy(curl_easy_init()
         curl_easy_setopt(_easy, CURLOPT_CAINFO, options.caFile.c_str());
         curl_easy_setopt(_easy, CURLOPT_CAPATH, nullptr);
     }
-    curl_easy_setopt(_easy, CURLOPT_HTTP_VERSION,
-                     static_cast<long>(options.http2 ? CURL_HTTP_VERSION_2TLS : CURL_HTTP_VERSION_1_1));
-    curl_easy_setopt(_easy, CURLOPT_PIPEWAIT, options.http2 ? 1L : 0L);
+    _http1Only = _offersHttp2; // the other way round, so that it is set
+    setVersion();
 }
 
 CurlSlot::~CurlSlot() {
@@ -92,6 +91,7 @@ void CurlSlot::prepare(std::unique_ptr<HttpJob> job, bool digest) {
     setHeaders();
     setCredentials(digest);
     setProxy();
+    setVersion();
     _plain = _job->origin.starts_with("http:");
     _bytesMoved = 0;
     _lastMove = std::chrono::steady_clock::now();
@@ -148,6 +148,16 @@ void CurlSlot::setCredentials(bool digest) {
     curl_easy_setopt(_easy, CURLOPT_USERNAME, wanted ? wanted->user.c_str() : nullptr);
     curl_easy_setopt(_easy, CURLOPT_PASSWORD, wanted ? wanted->password.c_str() : nullptr);
     curl_easy_setopt(_easy, CURLOPT_HTTPAUTH, static_cast<long>(digest ? CURLAUTH_DIGEST : CURLAUTH_BASIC));
+}
+
+void CurlSlot::setVersion() {
+    // HTTP/2 is agreed on in the TLS handshake only; waiting for it elsewhere would hold up the other connections.
+    const bool http1Only = !_offersHttp2 || (_job && (_job->http1Only || _job->origin.starts_with("http:")));
+    if (http1Only == _http1Only) return;
+    _http1Only = http1Only;
+    curl_easy_setopt(_easy, CURLOPT_HTTP_VERSION,
+                     static_cast<long>(http1Only ? CURL_HTTP_VERSION_1_1 : CURL_HTTP_VERSION_2TLS));
+    curl_easy_setopt(_easy, CURLOPT_PIPEWAIT, http1Only ? 0L : 1L);
 }
 
 void CurlSlot::setProxy() {

@@ -21,6 +21,7 @@ struct HttpJob {
     SteadyTime deadline;
     uint64_t epoch = 0; // of abortAll at the hand-over
     int repetitions = 0;
+    bool http1Only = false;
 
     HttpResponse response;
     bool headerDone = false; // of the final answer
@@ -61,11 +62,14 @@ private:
     void setHeaders();
     void setCredentials(bool digest);
     void setProxy();
+    void setVersion();
 
     CURL* _easy;
     curl_slist* _headers = nullptr;
     std::vector<std::pair<std::string, std::string>> _headersShown; // what `_headers` was built from
     std::shared_ptr<const TransportCredentials> _signedInAs;
+    const bool _offersHttp2;
+    bool _http1Only = false;
     bool _digest = false, _plain = false, _proxyOff = false;
     std::unique_ptr<HttpJob> _job;
     uint64_t _bytesMoved = 0;

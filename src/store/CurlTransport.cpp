@@ -364,9 +364,15 @@ void CurlTransport::Impl::finished(CurlSlot& slot, CURLcode code) {
     auto job = slot.release();
     if (version == CURL_HTTP_VERSION_2_0)
         http2Origins.insert(job->origin);
-    else if (code == CURLE_OK && !http2Origins.empty())
+    else if (code == CURLE_OK && !job->http1Only && !http2Origins.empty())
         http2Origins.erase(job->origin);
     // A server that refuses an upload before it has read it resets the stream behind its answer (RFC 9113 section 8.1).
+    // libcurl may drop the answer then; over HTTP/1.1 it comes through.
+    if (code == CURLE_HTTP2_STREAM && !job->headerDone && !job->http1Only && job->verdict == TransportError::none) {
+        job->http1Only = true;
+        pending.push_front(std::move(job));
+        return;
+    }
     const bool refusedEarly = code == CURLE_HTTP2_STREAM && job->headerDone && job->response.status >= 400;
     if (code != CURLE_OK && !refusedEarly) {
         const TransportError error = job->verdict != TransportError::none ? job->verdict : translated(code);

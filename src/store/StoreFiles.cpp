@@ -58,9 +58,15 @@ FileVersion versionOf(const HttpResponse& answer) {
     return v;
 }
 
+// A condition on this resource and no other: a list without a tag would be asked of the parent folder too.
+std::string taggedCondition(const Url& target, const std::string& state) {
+    return "<" + target.absoluteString() + "> (" + state + ")";
+}
+
 // The headers that make a write depend on what was read. A weak tag cannot be used with If-Match (RFC 9110 section
 // 13.1.1), but WebDAV's own If header compares weakly.
-std::vector<std::pair<std::string, std::string>> conditions(const ReadMark& mark, const LockToken& token) {
+std::vector<std::pair<std::string, std::string>> conditions(const ReadMark& mark, const LockToken& token,
+                                                            const Url& target) {
     std::vector<std::pair<std::string, std::string>> out;
     std::string state = token.empty() ? "" : "<" + token.str() + ">";
     if (mark.set && mark.state == ReadMark::State::absent) out.emplace_back("If-None-Match", "*");
@@ -70,7 +76,7 @@ std::vector<std::pair<std::string, std::string>> conditions(const ReadMark& mark
         else
             out.emplace_back("If-Match", mark.etag.str());
     }
-    if (!state.empty()) out.emplace_back("If", "(" + state + ")");
+    if (!state.empty()) out.emplace_back("If", taggedCondition(target, state));
     return out;
 }
 
@@ -230,7 +236,7 @@ int StoreFiles::write(const Url& name, std::string text, bool securely, const st
     const Url first = both && knownCollection(*url) ? state : *url;
     const auto body = std::make_shared<const std::string>(std::move(text));
     const auto attempt = [&](const Url& target) {
-        return put(name, target, body, conditions(mark, _tokens.tokenFor(target.absoluteString())));
+        return put(name, target, body, conditions(mark, _tokens.tokenFor(target.absoluteString()), target));
     };
     const int code = attempt(first);
     if (succeeded(code) || code == 0) return code;
@@ -254,7 +260,7 @@ int StoreFiles::remove(const Url& name) {
     _versions.forget(name.absoluteString());
     HttpRequest request = StoreSession::request("DELETE", *url);
     const LockToken token = _tokens.tokenFor(url->absoluteString());
-    if (!token.empty()) request.headers.emplace_back("If", "(<" + token.str() + ">)");
+    if (!token.empty()) request.headers.emplace_back("If", taggedCondition(*url, "<" + token.str() + ">"));
     return _session.send(std::move(request)).status;
 }
 

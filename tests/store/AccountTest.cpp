@@ -1,0 +1,210 @@
+#include "store/Account.h"
+#include "foundation/CXException.h"
+#include "foundation/Paths.h"
+#include "store/CXNetworkController.h"
+#include "store/VersionMemory.h"
+#include "support/TempHome.h"
+
+#include <filesystem>
+#include <fstream>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <rapidcheck.h>
+#include <sys/stat.h>
+
+namespace rolvane {
+namespace {
+
+using namespace test;
+using testing::HasSubstr;
+
+CXDAVAccount sample() {
+    CXDAVAccount a;
+    a.user = UserName("alice");
+    a.endpoint = "https://dav.example.org:8443/dav/{user}/Contacts";
+    return a;
+}
+
+std::string reasonOf(const PasswordSource& source) {
+    CXDAVAccount a = sample();
+    a.passwordSource = source;
+    try {
+        return "password: " + a.password();
+    } catch (const CXException& e) {
+        return e.reason();
+    }
+}
+
+TEST(Account, ALocationIsANameAndItsBytesAreWhereTheTemplateSays) {
+    const CXDAVAccount a = sample();
+    const Url base = a.baseLocationFor(UserName("bob b"));
+    EXPECT_EQ(base.absoluteString(), "http://dav.example.org:8443/bob%20b/Contacts");
+    EXPECT_EQ(a.endpointFor(base, false)->absoluteString(), "https://dav.example.org:8443/dav/bob%20b/Contacts");
+    EXPECT_EQ(a.endpointFor(base.cxURLByAppendingComponent("A:CXGroup"), true)->absoluteString(),
+              "https://dav.example.org:8443/dav/bob%20b/Contacts/A%3ACXGroup");
+}
+
+TEST(Account, NamesAndBytesAreEachOthersInverseForEveryUser) {
+    const CXDAVAccount a = sample();
+    const auto safe = [](char c) { return static_cast<unsigned char>(c) >= 0x20 && c != 0x7f && c != '/'; };
+    const auto segment = rc::gen::suchThat(
+        rc::gen::nonEmpty(rc::gen::container<std::string>(rc::gen::suchThat(rc::gen::arbitrary<char>(), safe))),
+        [](const std::string& s) { return s != "." && s != ".."; });
+    const bool held = rc::check([&] {
+        Url name = a.baseLocationFor(UserName(*segment));
+        for (const auto& below : *rc::gen::container<std::vector<std::string>>(segment))
+            name = name.cxURLByAppendingComponent(below);
+        const auto bytes = a.endpointFor(name, false);
+        RC_ASSERT(bytes.has_value());
+        RC_ASSERT(a.nameFor(bytes->absoluteString()) == name);
+        RC_ASSERT(a.nameFor(bytes->encodedPath() + "/") == name);
+    });
+    EXPECT_TRUE(held);
+}
+
+TEST(Account, ANameHostOfItsOwnKeepsLocationsWhenTheStoreMoves) {
+    CXDAVAccount a = sample();
+    a.nameHost = "contacts.example.org";
+    EXPECT_EQ(a.baseLocationFor(a.user).absoluteString(), "http://contacts.example.org/alice/Contacts");
+    EXPECT_TRUE(a.endpointFor(Url("http://Contacts.Example.org/alice/Contacts/info"), false));
+    EXPECT_FALSE(a.endpointFor(Url("http://dav.example.org:8443/alice/Contacts/info"), false));
+}
+
+TEST(Account, AnAccountIsSavedForItsOwnerOnlyAndComesBackTheSame) {
+    TempHome home;
+    EXPECT_FALSE(CXDAVAccount::load());
+    CXDAVAccount a = sample();
+    a.passwordSource = {PasswordSource::Kind::command, "echo x"};
+    a.authentication = Authentication::digest;
+    a.save();
+    struct stat st {};
+    ASSERT_EQ(stat(CXDAVAccount::defaultPath().c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 0777, 0600u);
+    EXPECT_EQ(CXDAVAccount::load(), a);
+}
+
+TEST(Account, WhatIsWrongWithAnAccountIsSaidInWords) {
+    const auto problem = [](auto change) {
+        CXDAVAccount a = sample();
+        change(a);
+        return a.problem().value_or("");
+    };
+    EXPECT_EQ(problem([](auto&) {}), "");
+    EXPECT_THAT(problem([](auto& a) { a.user = UserName(""); }), HasSubstr("no user name"));
+    EXPECT_THAT(problem([](auto& a) { a.user = UserName("<self>"); }), HasSubstr("cannot be a user name"));
+    EXPECT_THAT(problem([](auto& a) { a.user = UserName(".."); }), HasSubstr("cannot be a user name"));
+    EXPECT_THAT(problem([](auto& a) { a.endpoint = "https://h/dav/Contacts"; }), HasSubstr("{user}"));
+    EXPECT_THAT(problem([](auto& a) { a.endpoint = "https://u:p@h/{user}/Contacts"; }), HasSubstr("is not a URL"));
+    EXPECT_THAT(problem([](auto& a) { a.endpoint = "http://dav.example.org/{user}"; }), HasSubstr("not encrypted"));
+    EXPECT_THAT(problem([](auto& a) {
+                    a.endpoint = "http://dav.example.org/{user}";
+                    a.plainLoopback = true;
+                }),
+                HasSubstr("not encrypted"));
+    EXPECT_THAT(problem([](auto& a) { a.endpoint = "http://127.0.0.1/{user}"; }), HasSubstr("not encrypted"));
+    EXPECT_THAT(problem([](auto& a) {
+                    a.endpoint = "http://127.0.0.1/{user}";
+                    a.plainLoopback = true;
+                }),
+                HasSubstr("https endpoint"));
+    EXPECT_EQ(problem([](auto& a) {
+                  a.endpoint = "http://127.0.0.1:8/{user}";
+                  a.secureEndpoint = "https://127.0.0.1:9/{user}";
+                  a.plainLoopback = true;
+              }),
+              "");
+    EXPECT_THAT(problem([](auto& a) { a.caFile = "/nonexistent"; }), HasSubstr("/nonexistent"));
+    EXPECT_THAT(problem([](auto& a) { a.nameHost = "a/b"; }), HasSubstr("host name"));
+    EXPECT_THAT(problem([](auto& a) { a.passwordSource.kind = PasswordSource::Kind::file; }), HasSubstr("file"));
+}
+
+TEST(Account, SecureRequestsOfAPlainStoreGoToItsSecureEndpoint) {
+    CXDAVAccount a = sample();
+    a.endpoint = "http://127.0.0.1:8/{user}";
+    a.secureEndpoint = "https://127.0.0.1:9/{user}";
+    a.plainLoopback = true;
+    const Url name = a.baseLocationFor(a.user);
+    EXPECT_EQ(a.endpointFor(name, false)->absoluteString(), "http://127.0.0.1:8/alice");
+    EXPECT_EQ(a.endpointFor(name, true)->absoluteString(), "https://127.0.0.1:9/alice");
+}
+
+TEST(Account, ADamagedFileIsNamed) {
+    TempHome home;
+    std::ofstream(CXDAVAccount::defaultPath()) << "garbage";
+    EXPECT_THROW(
+        {
+            try {
+                CXDAVAccount::load();
+            } catch (const CXException& e) {
+                EXPECT_THAT(e.reason(), HasSubstr(CXDAVAccount::defaultPath()));
+                throw;
+            }
+        },
+        CXException);
+}
+
+TEST(Account, PasswordsComeFromTheirSources) {
+    TempHome home;
+    using Kind = PasswordSource::Kind;
+    EXPECT_EQ(reasonOf({Kind::command, "echo 'open sesame'; echo second"}), "password: open sesame");
+    EXPECT_THAT(reasonOf({Kind::command, "exit 3"}), HasSubstr("exit code 3"));
+    std::ofstream(home / "pw") << "s3cret\n";
+    chmod((home / "pw").c_str(), 0600);
+    EXPECT_EQ(reasonOf({Kind::file, home / "pw"}), "password: s3cret");
+    chmod((home / "pw").c_str(), 0644);
+    EXPECT_THAT(reasonOf({Kind::file, home / "pw"}), HasSubstr("chmod 600"));
+    EXPECT_THAT(reasonOf({Kind::file, home / "none"}), HasSubstr("cannot be read"));
+    home.setVariable("CREDENTIALS_DIRECTORY", home.path());
+    EXPECT_EQ(reasonOf({Kind::credential, "pw"}), "password: s3cret");
+    EXPECT_THAT(reasonOf({Kind::credential, "../pw"}), HasSubstr("cannot be the name"));
+    home.setVariable("CREDENTIALS_DIRECTORY", std::nullopt);
+    EXPECT_THAT(reasonOf({Kind::credential, "pw"}), HasSubstr("LoadCredential"));
+}
+
+TEST(Account, LoopbackIsToldByAddress) {
+    for (const char* h : {"localhost", "127.0.0.1", "127.9.9.9", "::1"}) EXPECT_TRUE(isLoopbackHost(h)) << h;
+    for (const char* h : {"localhost.example.org", "10.0.0.1", "1270.0.0.1", "", "::2"})
+        EXPECT_FALSE(isLoopbackHost(h)) << h;
+}
+
+TEST(NetworkController, LoopbackIsAlwaysReachableAndNoHostNever) {
+    CXNetworkController controller;
+    EXPECT_TRUE(controller.canReachAddress("localhost"));
+    EXPECT_TRUE(controller.canReachAddress("127.0.0.1"));
+    EXPECT_FALSE(controller.canReachAddress(""));
+}
+
+TEST(VersionMemory, KnowsWhatWasReadInAnotherRunAndForgetsDamage) {
+    TempDirectory directory;
+    const FileVersion v{EntityTag("\"a\""), Date(1000), 5};
+    {
+        VersionMemory m(directory / "v");
+        m.read("u", v);
+        m.save();
+    }
+    VersionMemory again(directory / "v");
+    EXPECT_TRUE(again.knows("u", v));
+    EXPECT_TRUE(again.knows("u", {EntityTag("W/\"a\""), Date(1000), 5}));
+    EXPECT_FALSE(again.knows("u", {EntityTag("\"b\""), Date(1000), 5}));
+    EXPECT_FALSE(again.knows("w", v));
+    std::filesystem::resize_file(directory / "v", 17);
+    EXPECT_FALSE(VersionMemory(directory / "v").knows("u", v));
+}
+
+TEST(VersionMemory, AWriteWithoutATagIsKnownBySizeAndServerDate) {
+    VersionMemory m;
+    m.wrote("u", EntityTag(), Date(1000), 5);
+    EXPECT_FALSE(m.knows("u", {EntityTag("\"x\""), Date(1002), 5}));
+    EXPECT_FALSE(m.knows("u", {EntityTag("\"x\""), Date(1000), 6}));
+    EXPECT_TRUE(m.knows("u", {EntityTag("\"x\""), Date(999), 5}));
+    EXPECT_FALSE(m.knows("u", {EntityTag("\"y\""), Date(1000), 5})) << "once its tag is known, only that";
+}
+
+TEST(VersionMemory, IsBounded) {
+    VersionMemory m({}, 10);
+    for (int i = 0; i < 100; ++i) m.read(std::to_string(i), {EntityTag("\"a\""), {}, 0});
+    EXPECT_EQ(m.count(), 10u);
+}
+
+} // namespace
+} // namespace rolvane

@@ -1,0 +1,159 @@
+#include "StoreWorld.h"
+#include "foundation/Paths.h"
+#include "store/CXWebDAVLock.h"
+#include "store/StoreLock.h"
+#include "support/ChildProcess.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+namespace rolvane {
+namespace {
+
+using namespace test;
+
+class Locks : public testing::Test {
+protected:
+    void SetUp() override { ASSERT_TRUE(alice.manager.sanityCheckPublishStructureCreate(true)); }
+    std::shared_ptr<CXWebDAVLock> lock(Client& client) { return makeStoreLock(client.manager, client.at("dateFile")); }
+
+    StoreWorld world;
+    Client alice{world};
+    Client second{world};
+};
+
+TEST_F(Locks, ALockIsTakenByOneClientAtATime) {
+    auto mine = lock(alice), theirs = lock(second);
+    EXPECT_FALSE(mine->locked());
+    ASSERT_TRUE(mine->tryLock());
+    EXPECT_TRUE(mine->locked());
+    EXPECT_NEAR(mine->expires().secondsSince(Clock::system().now()), CXWebDAVLock::lockTimeout(), 5);
+    EXPECT_FALSE(theirs->tryLock());
+    EXPECT_FALSE(theirs->locked());
+    mine->unlock();
+    EXPECT_FALSE(mine->locked());
+    EXPECT_TRUE(theirs->tryLock());
+    theirs->unlock();
+}
+
+TEST_F(Locks, TakingAHeldLockAgainAsksNobody) {
+    auto mine = lock(alice);
+    ASSERT_TRUE(mine->tryLock());
+    alice.wire->clear();
+    EXPECT_TRUE(mine->tryLock());
+    EXPECT_EQ(alice.wire->methods(), "");
+    mine->unlock();
+    EXPECT_EQ(alice.wire->methods(), "UNLOCK");
+    mine->unlock();
+    EXPECT_EQ(alice.wire->methods(), "UNLOCK");
+}
+
+TEST_F(Locks, TheHolderWritesTheLockedFileAndOthersDoNot) {
+    auto mine = lock(alice);
+    ASSERT_TRUE(mine->tryLock());
+    EXPECT_EQ(alice.write("dateFile", "why"), 204);
+    EXPECT_EQ(second.write("dateFile", "who"), 423);
+    EXPECT_EQ(second.write("People/1/A:CXPerson", "free"), 201) << "only the clock file is locked";
+    mine->unlock();
+    EXPECT_EQ(second.write("dateFile", "why"), 204);
+}
+
+TEST_F(Locks, ARenewedLockExpiresLaterAndStaysHeld) {
+    auto mine = lock(alice);
+    ASSERT_TRUE(mine->tryLock());
+    const Date before = mine->expires();
+    EXPECT_TRUE(mine->renew());
+    EXPECT_GE(mine->expires(), before);
+    EXPECT_FALSE(lock(second)->tryLock());
+    mine->unlock();
+}
+
+TEST_F(Locks, ALockThatTheStoreForgotIsLostAtItsRenewal) {
+    auto mine = lock(alice);
+    ASSERT_TRUE(mine->tryLock());
+    for (const auto& e : alice.wire->exchanges()) ASSERT_NE(e.status, 0);
+    int code = 0;
+    ASSERT_TRUE(alice.manager.removeFileAtURL(alice.at("dateFile"), &code)) << code; // takes the lock with it
+    EXPECT_FALSE(mine->renew());
+    EXPECT_FALSE(mine->locked());
+    EXPECT_EQ(alice.write("dateFile", "why"), 201) << "the lost token is not sent any more";
+}
+
+TEST_F(Locks, ALockOfARunThatWasKilledIsTakenOverAndOnesOfLivingRunsAreNot) {
+    auto mine = lock(alice);
+    ASSERT_TRUE(mine->tryLock());
+    EXPECT_FALSE(lock(second)->tryLock()) << "the holder lives";
+    // The note that a run with another process leaves behind when it is killed.
+    std::filesystem::path note;
+    for (const auto& e : std::filesystem::directory_iterator(stateDirectory() + "/locks")) note = e.path();
+    std::string text = readFile(note);
+    writeFileDurably(note, "1 0" + text.substr(text.find('\n')));
+    auto next = lock(second);
+    EXPECT_TRUE(next->tryLock());
+    EXPECT_EQ(second.write("dateFile", "why"), 204);
+    next->unlock();
+    EXPECT_FALSE(mine->renew());
+}
+
+TEST_F(Locks, AnUnheldLockNeverLooksSoonToExpire) {
+    auto mine = lock(alice);
+    EXPECT_GT(mine->expires().secondsSince(Clock::system().now()), CXWebDAVLock::lockTimeout() - 5);
+    EXPECT_FALSE(mine->renew());
+    mine->unlock();
+    EXPECT_EQ(alice.wire->count("UNLOCK"), 0u);
+}
+
+TEST_F(Locks, AStoreThatCannotBeReachedGivesNoLock) {
+    auto mine = lock(alice);
+    world.store.stop();
+    EXPECT_FALSE(mine->tryLock());
+    EXPECT_FALSE(mine->locked());
+}
+
+class FileLocks : public testing::Test {
+protected:
+    TempDirectory directory;
+    Url url = Url::fileURL(directory / ".lock");
+    ManualClock clock{Date(1800000000)};
+};
+
+TEST_F(FileLocks, OneHolderAtATime) {
+    auto a = makeFileLock(url, clock), b = makeFileLock(url, clock);
+    ASSERT_TRUE(a->tryLock());
+    EXPECT_FALSE(b->tryLock());
+    EXPECT_EQ(a->url(), url);
+    EXPECT_EQ(a->expires(), clock.now().addingSeconds(CXWebDAVLock::lockTimeout()));
+    a->unlock();
+    EXPECT_TRUE(b->tryLock());
+    b->unlock();
+    EXPECT_TRUE(std::filesystem::is_empty(directory.path()));
+}
+
+TEST_F(FileLocks, AnExpiredLockIsTakenOverAndItsHolderLearnsItAtTheRenewal) {
+    auto a = makeFileLock(url, clock), b = makeFileLock(url, clock);
+    ASSERT_TRUE(a->tryLock());
+    clock.advance(CXWebDAVLock::lockTimeout() + 1);
+    EXPECT_TRUE(b->tryLock());
+    EXPECT_FALSE(a->renew());
+    EXPECT_FALSE(a->locked());
+    a->unlock();
+    EXPECT_FALSE(makeFileLock(url, clock)->tryLock()) << "the former holder must not release it";
+}
+
+TEST_F(FileLocks, ARenewedLockIsNotTakenOver) {
+    auto a = makeFileLock(url, clock), b = makeFileLock(url, clock);
+    ASSERT_TRUE(a->tryLock());
+    clock.advance(CXWebDAVLock::lockTimeout() - 10);
+    EXPECT_TRUE(a->renew());
+    clock.advance(CXWebDAVLock::lockTimeout() - 10);
+    EXPECT_FALSE(b->tryLock());
+}
+
+TEST_F(FileLocks, AFolderThatIsMissingGivesNoLock) {
+    EXPECT_FALSE(makeFileLock(Url::fileURL(directory / "no/.lock"), clock)->tryLock());
+}
+
+} // namespace
+} // namespace rolvane
