@@ -71,14 +71,12 @@ CXDChangeRecords EngineState::getPendingChanges() const {
 }
 
 void EngineState::setPendingChanges(const CXDChangeRecords& records) {
-    std::vector<KeyedArchive::Object> objects;
-    objects.reserve(records.size());
-    for (const CXDChangeRecordPtr& record : records) {
+    const auto archived = [&](size_t i) {
         DictionaryCoder coder;
-        record->encodeWithCoder(coder);
-        objects.push_back({kRecordClass, coder.entries()});
-    }
-    _preferences.set(kDaemonDomain, kCXDPendingChanges, KeyedArchive::archive(objects));
+        records[i]->encodeWithCoder(coder);
+        return KeyedArchive::Object{kRecordClass, coder.entries()};
+    };
+    _preferences.set(kDaemonDomain, kCXDPendingChanges, KeyedArchive::archive(records.size(), archived));
     _preferences.synchronize(kDaemonDomain);
 }
 

@@ -84,10 +84,10 @@ void OutOfOrderWork::outOfOrderWorkLoop() {
 
         const int32_t wanted = record->appliesToSources();
         const int32_t applied = _parts.terminating ? 0 : apply(record, denied);
+        if (applied != wanted || record.use_count() > 1) record->packPayload(); // somebody keeps it
         record->setAppliedToSources(applied);
         if (applied != wanted) {
             record->setAppliesToSources(applied ^ wanted);
-            record->packPayload();
             const std::lock_guard guard(_processedChangesLock);
             _pending.push_back(record);
         }

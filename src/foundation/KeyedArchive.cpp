@@ -14,6 +14,21 @@ constexpr std::string_view kMagic = "RKA1";
     throw CXException(kCXArchiveException, "the keyed archive cannot be read: " + reason);
 }
 
+void appendVarint(uint64_t n, Bytes& out) {
+    for (; n >= 0x80; n >>= 7) out.push_back(static_cast<uint8_t>(n) | 0x80);
+    out.push_back(static_cast<uint8_t>(n));
+}
+
+// What stands before the elements in the BinaryValue form of {key: array of `count` elements}.
+void beginDictionaryOfOneArray(std::string_view key, size_t count, Bytes& out) {
+    out.push_back(static_cast<uint8_t>(ValueType::dictionary));
+    appendVarint(1, out);
+    appendVarint(key.size(), out);
+    out.insert(out.end(), key.begin(), key.end());
+    out.push_back(static_cast<uint8_t>(ValueType::array));
+    appendVarint(count, out);
+}
+
 KeyedArchive::Object objectFrom(const Value& v) {
     const Dictionary* entry = v.dictionaryIf();
     if (!entry) refuse("an object in it is not a dictionary");
@@ -42,11 +57,16 @@ Value DictionaryCoder::decodeObject(std::string_view key) const {
 }
 
 Bytes KeyedArchive::archive(const std::vector<Object>& objects) {
-    std::vector<Value> entries;
-    entries.reserve(objects.size());
-    for (const Object& o : objects) entries.emplace_back(Dictionary{{"class", o.className}, {"keys", o.keys}});
+    return archive(objects.size(), [&](size_t i) { return objects[i]; });
+}
+
+Bytes KeyedArchive::archive(size_t count, const std::function<Object(size_t)>& objectAt) {
     Bytes out(kMagic.begin(), kMagic.end());
-    BinaryValue::encodeTo(Dictionary{{"objects", Array(std::move(entries))}}, out);
+    beginDictionaryOfOneArray("objects", count, out);
+    for (size_t i = 0; i < count; ++i) {
+        const Object object = objectAt(i);
+        BinaryValue::encodeTo(Dictionary{{"class", object.className}, {"keys", object.keys}}, out);
+    }
     return out;
 }
 

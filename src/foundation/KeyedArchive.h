@@ -47,6 +47,8 @@ public:
         Dictionary keys;
     };
     static Bytes archive(const std::vector<Object>& objects);
+    // The same bytes from objects that are made one after the other, so that they never stand in memory together.
+    static Bytes archive(size_t count, const std::function<Object(size_t)>& objectAt);
     static std::vector<Object> unarchive(const Bytes& bytes); // throws kCXArchiveException
 };
 
