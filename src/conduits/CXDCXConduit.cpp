@@ -17,6 +17,11 @@ namespace {
 // From so many changed records on, a group's distribution choices are read at once.
 constexpr size_t kMany = 16;
 
+// Whatever such an identifier finds is a person, whose row is all that is needed of it.
+bool namesPerson(const UniqueId& uid) {
+    return uid.endsWith("Person");
+}
+
 template <class GroupClass>
 CXSearchElement groupsModifiedAfter(Date date) {
     return GroupClass::searchElementForProperty(kCXModificationDateProperty, "", "", date, kCXGreaterThan);
@@ -118,26 +123,29 @@ void CXDCXConduit::rolvaneChanged(const Notification& notification) {
 
 void CXDCXConduit::captureInserted(ChangeCapture& capture, const Array& identifiers) {
     for (const Value& identifier : identifiers) {
-        const CXRecordRef record = recordForUniqueId(UniqueId(identifier.string()));
-        if (const auto group = std::dynamic_pointer_cast<CXGroup>(record))
-            capture.addGroup(group);
-        else if (std::dynamic_pointer_cast<CXPerson>(record))
-            capture.addPerson(rolvane().personRow(record->uniqueId()), false);
+        const UniqueId uid(identifier.string());
+        if (namesPerson(uid))
+            capture.addPerson(capture.reader().personForUniqueId(uid), false);
+        else
+            capture.addGroup(std::dynamic_pointer_cast<CXGroup>(recordForUniqueId(uid)));
     }
 }
 
 void CXDCXConduit::captureUpdated(ChangeCapture& capture, const Array& identifiers) {
     for (const Value& identifier : identifiers) {
-        const CXRecordRef record = recordForUniqueId(UniqueId(identifier.string()));
-        if (const auto group = std::dynamic_pointer_cast<CXGroup>(record))
-            capture.addGroup(group);
-        else if (std::dynamic_pointer_cast<CXPerson>(record))
-            capture.addPerson(rolvane().personRow(record->uniqueId()), true);
-        else if (const auto contents = std::dynamic_pointer_cast<CXGroupContents>(record))
+        const UniqueId uid(identifier.string());
+        if (namesPerson(uid)) {
+            capture.addPerson(capture.reader().personForUniqueId(uid), true);
+            continue;
+        }
+        const CXRecordRef record = recordForUniqueId(uid);
+        if (const auto contents = std::dynamic_pointer_cast<CXGroupContents>(record))
             // The very group whose contents changed, not a subscribed copy of it.
             capture.addGroup(std::dynamic_pointer_cast<CXGroup>(rolvane().recordForUniqueId(contents->nts_GroupUID())));
         else if (std::dynamic_pointer_cast<CXInfo>(record))
             capture.addGroup(rolvane().allGroup());
+        else
+            capture.addGroup(std::dynamic_pointer_cast<CXGroup>(record));
     }
 }
 
