@@ -1,0 +1,181 @@
+#include "daemon/Daemon.h"
+
+#include "conduits/CXDCXConduit.h"
+#include "conduits/CXDVaultraConduit.h"
+#include "contacts/CXAllGroup.h"
+#include "contacts/CXRolvane.h"
+#include "contacts/CXUserDefaults.h"
+#include "daemon/CXDProgressManager.h"
+#include "daemon/CheckIn.h"
+#include "daemon/DesktopAlert.h"
+#include "daemon/InstanceLock.h"
+#include "daemon/TerminationWatch.h"
+#include "engine/CXDSyncEngine.h"
+#include "foundation/Log.h"
+#include "foundation/Paths.h"
+#include "store/CXDAVManager.h"
+#include "store/CXNetworkController.h"
+
+#include <atomic>
+#include <cstdio>
+#include <cstring>
+#include <optional>
+#include <sys/eventfd.h>
+#include <systemd/sd-daemon.h>
+#include <unistd.h>
+
+namespace rolvane {
+
+namespace {
+
+// Everything that counts is durable at any moment, so the process ends at once, whatever its other threads do.
+class UnixProcessEnd : public ProcessEnd {
+public:
+    [[noreturn]] void end(int status) override {
+        sd_notify(0, "STOPPING=1");
+        std::fflush(nullptr);
+        ::_exit(status);
+    }
+};
+
+// What the watch's thread may touch while the main thread is at work.
+struct Termination {
+    int event = ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK); // readable: the loop is to end the process
+    std::atomic<bool> asked = false;
+    std::atomic<CXDSyncEngine*> engine = nullptr;
+    std::atomic<CXDAVManager*> store = nullptr;
+
+    void ask() {
+        asked = true;
+        if (CXDSyncEngine* running = engine.load()) running->requestTermination();
+        if (CXDAVManager* client = store.load()) client->abortAll();
+        const uint64_t one = 1;
+        [[maybe_unused]] const ssize_t n = ::write(event, &one, sizeof one);
+    }
+};
+
+Termination& termination() {
+    static Termination state;
+    return state;
+}
+
+// The process's collaborators, made in the order in which they need each other; they live until the process ends.
+class Daemon {
+public:
+    Daemon() : _loop(RunLoop::current()), _bus(makeBusNotifications(_loop)), _progress(*_bus) {
+        _terminated = _loop.addPort(termination().event, [this](uint32_t) { terminate(); });
+    }
+
+    void readDebugLevel() {
+        setDebugLevel(static_cast<int>(Preferences::shared().get(kDaemonDomain, "CXDDebugLevel").integer()));
+    }
+
+    void parseArguments(int argc, char** argv) {
+        for (int i = 1; i < argc; ++i)
+            if (std::strcmp(argv[i], "-p") == 0) IdleExit::process().setInterval(0);
+    }
+
+    void openDatabase() {
+        CXRolvane::Options options;
+        options.program = "RolvaneManager";
+        options.distributed = _bus.get();
+        options.runLoop = &_loop;
+        CXRolvane::configureShared(options);
+        CXRolvane::sharedRolvane().recoverShareCount(Preferences::shared());
+        CXDSyncEngine::setMaker([this] { return makeEngine(); });
+    }
+
+    bool publishes() const {
+        const auto locations = CXAllGroup::allGroup()->multiValueForProperty(kCXRemoteLocationProperty);
+        return locations && locations->count() != 0;
+    }
+
+    bool subscribes() const {
+        for (const CXSubscriptionRef& subscription : CXRolvane::sharedRolvane().subscriptions())
+            if (subscription->remoteLocation() != RemoteLocation("local")) return true;
+        return false;
+    }
+
+    void firstPass() {
+        CXDLog("Sharing synchronization update started.");
+        CXDSyncEngine::sharedSyncEngine().bringSourcesUpToDate();
+        CXDLog("Sharing synchronization update completed.");
+    }
+
+    void serve() { _loop.runUntil(Date::distantFuture()); }
+
+private:
+    std::unique_ptr<CXDSyncEngine> makeEngine() {
+        CXDAVManager& store = CXDAVManager::defaultManager();
+        termination().store = &store;
+        CXNetworkController::sharedNetworkController().startMonitoring(_loop, NotificationCenter::defaultCenter());
+        _account = makeStoreNetworkAccount();
+        auto engine = std::make_unique<CXDSyncEngine>(EngineCollaborators{
+            CXRolvane::sharedLocalRolvane(), Preferences::shared(), *_bus, _loop, Clock::system(), _progress,
+            _processEnd, *_account, IdleExit::process(), [](const Url& url) { return CXWebDAVLock::initWithURL(url); },
+            [this, &store](ConduitEngine& owner) { return makeConduits(owner, store); }, loginUserName(), nullptr});
+        _progress.setEngine(engine.get(), engine.get());
+        termination().engine = engine.get();
+        if (termination().asked) termination().ask(); // it came while the engine was being made
+        return engine;
+    }
+
+    EngineConduits makeConduits(ConduitEngine& engine, CXDAVManager& store) {
+        auto vaultra = std::make_unique<CXDVaultraConduit>(
+            engine, CXDVaultraConduit::World{store, CXNetworkController::sharedNetworkController(),
+                                             Preferences::shared(), Clock::system(),
+                                             NotificationCenter::defaultCenter(), *_bus, _alert, makePlainACLManager});
+        auto cx = std::make_unique<CXDCXConduit>(engine, CXDCXConduit::World{CXRolvane::sharedLocalRolvane(),
+                                                                             Preferences::shared(), Clock::system(),
+                                                                             NotificationCenter::defaultCenter()});
+        CXDVaultraConduit* network = vaultra.get();
+        return {std::move(cx), std::move(vaultra), [network] { return network->vaultraOffLine(); }};
+    }
+
+    void terminate() {
+        if (CXDSyncEngine* engine = CXDSyncEngine::sharedSyncEngineIfMade()) engine->killCXD();
+        _processEnd.end(0);
+    }
+
+    RunLoop& _loop;
+    std::unique_ptr<DistributedNotifications> _bus;
+    CXDProgressManager _progress;
+    UnixProcessEnd _processEnd;
+    DesktopAlert _alert;
+    std::unique_ptr<NetworkAccount> _account;
+    RunLoop::Handle _terminated;
+};
+
+} // namespace
+
+int runDaemon(int argc, char** argv) {
+    constexpr double kTerminationGrace = 4.5; // seconds; the promise is five
+    const TerminationWatch watch([] { termination().ask(); }, kTerminationGrace);
+    try {
+        Daemon daemon;
+        daemon.readDebugLevel();
+        CXDLog("Parsing arguments.");
+        daemon.parseArguments(argc, argv);
+
+        const std::string lockPath = InstanceLock::defaultPath();
+        const auto lock = InstanceLock::acquire(lockPath);
+        if (!lock) {
+            CXLog("RolvaneManager is already running (process %d) and serves this user; this one ends.",
+                  InstanceLock::holder(lockPath).value_or(0));
+            return 0;
+        }
+        CXDLog("Checking in with kickerd.");
+        const CheckInPorts ports = CXDCheckIn(RunLoop::current());
+
+        daemon.openDatabase();
+        if (daemon.publishes() || daemon.subscribes()) daemon.firstPass();
+        CXDSyncEngine::persist();
+        CXDLog("Entering main run loop.");
+        daemon.serve();
+    } catch (const CXException& exception) {
+        CXLog("Quitting due to an unhandled exception: %@", exception);
+    }
+    return 0;
+}
+
+} // namespace rolvane
