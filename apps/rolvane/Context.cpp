@@ -95,7 +95,7 @@ CLI::App* addCommand(CLI::App& parent, Context& context, const std::string& name
     command->add_flag("--json", context.json, "Print data as one JSON document");
     command->add_flag("-q,--quiet", context.quiet, "No messages but errors");
     if (declare) declare(*command);
-    command->final_callback(std::move(body));
+    if (body) command->final_callback(std::move(body));
     return command;
 }
 

@@ -1,7 +1,205 @@
 #include "Context.h"
+#include "PassWatch.h"
+#include "Publication.h"
+
+#include "daemon/DaemonControl.h"
+#include "engine/EngineState.h"
+#include "store/CXDAVManager.h"
+
+#include <csignal>
+#include <fmt/format.h>
+#include <iostream>
+#include <sys/signalfd.h>
+#include <unistd.h>
 
 namespace rolvane::cli {
 
-void addDaemonCommands(CLI::App&, Context&) {}
+namespace {
+
+using Json = nlohmann::ordered_json;
+
+void daemonStart(Context& context) {
+    const DaemonControl daemon;
+    const bool started = daemon.start();
+    context.say(started ? "RolvaneManager is at work."
+                        : fmt::format("RolvaneManager runs already (process {}).", daemon.running().value_or(0)));
+}
+
+void daemonStop(Context& context) {
+    context.say(DaemonControl().stop() ? "RolvaneManager has ended." : "RolvaneManager was not running.");
+}
+
+// Exit code 0 when it runs, 3 when it does not.
+void daemonStatus(Context& context) {
+    const auto pid = DaemonControl().running();
+    if (context.json)
+        context.print({{"running", pid.has_value()}, {"process", pid ? Json(*pid) : Json()}});
+    else
+        context.line(pid ? fmt::format("RolvaneManager runs (process {}).", *pid) : "RolvaneManager is not running.");
+    if (!pid) context.exitCode = kNotFound;
+}
+
+Json dateOrNull(const Value& value) {
+    return value.date() ? Json(value.date()->toISO8601()) : Json();
+}
+
+Json storeStatus() {
+    const CXDAVAccount& account = CXDAVManager::defaultManager().account();
+    if (account.user.empty()) return Json();
+    CXDAVError error;
+    const bool reachable = CXDAVManager::canReachOstrelError(error);
+    return {{"user", account.user.str()},
+            {"endpoint", account.endpoint},
+            {"location", CXDAVManager::ostrelBaseLocationForOstrelUser(account.user).absoluteString()},
+            {"reachable", reachable},
+            {"reason", reachable ? Json() : Json(error.reason)}};
+}
+
+Json status(Context& context) {
+    CXRolvane& database = context.database();
+    Preferences& preferences = Preferences::shared();
+    Publication publication(database);
+    Json groups = Json::array(), subscriptions = Json::array();
+    for (const CXGroupRef& group : publication.groups())
+        groups.push_back({{"identifier", group->uniqueId().str()}, {"name", group->name()}});
+    for (const CXSubscriptionRef& s : database.subscriptions())
+        if (!s->isLocal() && s->remoteLocation() != RemoteLocation(Publication::kGroupsLocation))
+            subscriptions.push_back({{"location", s->remoteLocation().str()}, {"name", s->name()}});
+    const auto pid = DaemonControl().running();
+    return {{"people", database.countPeople(RemoteLocation(""))},
+            {"groups", database.listGroups(RemoteLocation("")).size()},
+            {"daemon", pid ? Json(*pid) : Json()},
+            {"store", storeStatus()},
+            {"published", {{"everything", publication.everything()}, {"groups", groups}}},
+            {"subscriptions", subscriptions},
+            {"pending", EngineState(preferences).getPendingChanges().size()},
+            {"lastPass", dateOrNull(preferences.get(kDaemonDomain, kCXDCXConduitLastSyncDate))},
+            {"lastStorePass", dateOrNull(preferences.get(kDaemonDomain, kCXDVaultraConduitLastSyncDate))}};
+}
+
+std::string publishedText(const Json& published) {
+    if (published["everything"].get<bool>()) return "the whole contact list";
+    if (published["groups"].empty()) return "nothing";
+    std::string names;
+    for (const Json& group : published["groups"])
+        names += (names.empty() ? "" : ", ") + group["name"].get<std::string>();
+    return (published["groups"].size() == 1 ? "the group " : "the groups ") + names;
+}
+
+void showStatus(Context& context) {
+    const Json s = status(context);
+    if (context.json) return context.print(s);
+    const auto row = [&](const std::string& label, const std::string& text) {
+        context.line(fmt::format("{:<15}{}", label, text));
+    };
+    row("Contacts", fmt::format("{} people, {} groups", s["people"].get<size_t>(), s["groups"].get<size_t>()));
+    row("Daemon", s["daemon"].is_null() ? "not running (`rolvane daemon start`)"
+                                        : fmt::format("running, process {}", s["daemon"].get<int>()));
+    if (s["store"].is_null()) {
+        row("Store", "no account yet (`rolvane account set`)");
+    } else {
+        const Json& store = s["store"];
+        row("Store", fmt::format("{} at {}", store["user"].get<std::string>(), store["endpoint"].get<std::string>()));
+        row("", store["reachable"].get<bool>() ? "can be reached"
+                                               : "cannot be used: " + store["reason"].get<std::string>());
+    }
+    row("Published", publishedText(s["published"]));
+    row("Subscriptions", fmt::format("{}", s["subscriptions"].size()));
+    row("Waiting", fmt::format("{} changes", s["pending"].get<size_t>()));
+    row("Last pass", s["lastPass"].is_null() ? "never" : s["lastPass"].get<std::string>());
+}
+
+// The terminal's end of a watch: interrupt and termination end it in order.
+class Interrupt {
+public:
+    explicit Interrupt(RunLoop& loop) {
+        sigset_t set;
+        sigemptyset(&set);
+        sigaddset(&set, SIGINT);
+        sigaddset(&set, SIGTERM);
+        sigprocmask(SIG_BLOCK, &set, nullptr);
+        _fd = ::signalfd(-1, &set, SFD_CLOEXEC | SFD_NONBLOCK);
+        _source = loop.addPort(_fd, [this](uint32_t) { _came = true; });
+    }
+    ~Interrupt() {
+        _source.reset();
+        ::close(_fd);
+    }
+    bool came() const { return _came; }
+
+private:
+    int _fd = -1;
+    bool _came = false;
+    RunLoop::Handle _source;
+};
+
+struct WatchOptions {
+    bool once = false;
+    double seconds = 0; // 0: until it is interrupted
+};
+
+void watch(Context& context, const WatchOptions& options) {
+    if (!context.bus().connected())
+        throw CommandError(kUnreachable, "There is no session bus, so the daemon cannot be heard. Log in to a session, "
+                                         "or set DBUS_SESSION_BUS_ADDRESS.");
+    PassWatch pass(context);
+    Interrupt interrupt(context.loop());
+    std::unique_ptr<ProgressBar> bar;
+    const bool draw = context.dataIsTerminal() && context.talkIsTerminal() && !context.json;
+    pass.onEvent = [&](const PassWatch::Event& event) {
+        using Kind = PassWatch::Event::Kind;
+        if (context.json) {
+            Json data{{"event", event.kind == Kind::started    ? "started"
+                                : event.kind == Kind::progress ? "progress"
+                                                               : "stopped"}};
+            if (event.kind == Kind::progress) {
+                data["location"] = event.location;
+                data["fraction"] = event.fraction;
+            }
+            context.line(data.dump());
+        } else if (event.kind == Kind::progress && draw) {
+            if (!bar) bar = std::make_unique<ProgressBar>(context, "Synchronising");
+            bar->update(event.fraction, event.location);
+        } else {
+            bar.reset();
+            if (event.kind == Kind::started) context.line("started");
+            if (event.kind == Kind::stopped) context.line("stopped");
+            if (event.kind == Kind::progress)
+                context.line(fmt::format("{} {:.1f}%", event.location, event.fraction * 100));
+        }
+        std::fflush(stdout);
+        std::cout.flush();
+    };
+    constexpr double kForever = 1e9;
+    const bool ended = pass.waitUntil([&] { return interrupt.came() || (options.once && pass.stopped() > 0); },
+                                      options.seconds > 0 ? options.seconds : kForever);
+    if (!ended && options.once)
+        throw CommandError(kUnreachable, fmt::format("No pass ended within {} seconds.", options.seconds));
+}
+
+} // namespace
+
+void addDaemonCommands(CLI::App& app, Context& context) {
+    CLI::App* daemon = addCommand(app, context, "daemon", "Start, stop and find the daemon", nullptr, nullptr);
+    daemon->require_subcommand(1);
+    addCommand(*daemon, context, "start", "Start it, unless it runs", nullptr, [&context] { daemonStart(context); });
+    addCommand(*daemon, context, "stop", "End it; what waits is kept", nullptr, [&context] { daemonStop(context); });
+    addCommand(*daemon, context, "restart", "End it if it runs, and start it", nullptr, [&context] {
+        DaemonControl().restart();
+        context.say("RolvaneManager is at work.");
+    });
+    addCommand(*daemon, context, "status", "Tell whether it runs (exit code 0 or 3)", nullptr,
+               [&context] { daemonStatus(context); });
+    addCommand(app, context, "status", "Tell what is shared and how far everything is", nullptr,
+               [&context] { showStatus(context); });
+    const auto options = std::make_shared<WatchOptions>();
+    addCommand(
+        app, context, "watch", "Show the daemon's progress as it comes",
+        [&](CLI::App& command) {
+            command.add_flag("--once", options->once, "End with the first pass that ends");
+            command.add_option("--seconds", options->seconds, "End after so many seconds");
+        },
+        [&context, options] { watch(context, *options); });
+}
 
 } // namespace rolvane::cli

@@ -73,6 +73,7 @@ void publish(Context& context, const PublishOptions& options) {
     const CXGroupRef group = options.group.empty() ? nullptr : findGroup(database, options.group);
     const bool changed = group ? publication.publishGroup(group, base) : publication.publishEverything(base);
     database.save();
+    const int64_t position = database.journalPosition();
     const std::string what = group ? fmt::format("The group \"{}\"", group->name()) : "The contact list";
     if (!changed) {
         context.say(fmt::format("{} is published already at {}.", what, base.absoluteString()));
@@ -87,7 +88,7 @@ void publish(Context& context, const PublishOptions& options) {
     else
         daemon.start();
     if (options.noWait) return;
-    waitForPass(context, watch, database.journalPosition(), options.timeout);
+    waitForPass(context, watch, position, options.timeout);
     reportResult(context);
     if (context.exitCode == kOk) context.say("Everything is on the store.");
 }

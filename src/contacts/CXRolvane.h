@@ -147,6 +147,8 @@ public:
     // The journal's end. A full scan takes it before it starts.
     int64_t journalPosition();
     int64_t cursorPosition();
+    // Another program's cursor, to see how far it has come; -1 when it has never watched this database.
+    int64_t cursorPosition(const std::string& program);
     // After a pass whose full scan read everything modified after `scannedSince` and compared all groups: moves the
     // cursor to the position taken before that scan, so that what was captured is not delivered once more. Entries of
     // saves dated at or before `scannedSince` were not captured (they were saved while an earlier pass ended): the

@@ -92,6 +92,11 @@ int64_t CXRolvane::cursorPosition() {
     return _impl->cursor();
 }
 
+int64_t CXRolvane::cursorPosition(const std::string& program) {
+    std::lock_guard lock(_impl->mutex);
+    return _impl->journal.cursor(program).value_or(-1);
+}
+
 void CXRolvane::advanceCursorTo(int64_t position, Date scannedSince) {
     std::lock_guard lock(_impl->mutex);
     int64_t from = _impl->cursor();
