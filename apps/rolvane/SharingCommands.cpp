@@ -7,6 +7,7 @@
 #include "contacts/Constants.h"
 #include "daemon/DaemonControl.h"
 #include "engine/EngineState.h"
+#include "foundation/PropertyList.h"
 #include "store/CXDAVManager.h"
 
 #include <fmt/format.h>
