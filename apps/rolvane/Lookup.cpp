@@ -1,0 +1,69 @@
+#include "Lookup.h"
+
+#include "Context.h"
+
+#include <algorithm>
+#include <fmt/format.h>
+
+namespace rolvane::cli {
+
+namespace {
+
+constexpr size_t kIdentifierStart = 4; // characters of an identifier that are enough to name it
+
+std::string folded(std::string text) {
+    for (char& c : text)
+        if (c >= 'A' && c <= 'Z') c = static_cast<char>(c - 'A' + 'a');
+    return text;
+}
+
+// The listings that the words fit best: identifier, start of one, whole name, part of a name; the first rule that finds
+// any wins.
+std::vector<CXListing> matches(const std::vector<CXListing>& all, const std::string& named) {
+    const std::string wanted = folded(named);
+    const auto chosen = [&](const auto& rule) {
+        std::vector<CXListing> found;
+        std::copy_if(all.begin(), all.end(), std::back_inserter(found), rule);
+        return found;
+    };
+    if (auto found = chosen([&](const CXListing& l) { return folded(l.uniqueId.str()) == wanted; }); !found.empty())
+        return found;
+    if (auto found = chosen([&](const CXListing& l) { return l.displayName == named; }); !found.empty()) return found;
+    if (auto found = chosen([&](const CXListing& l) { return folded(l.displayName) == wanted; }); !found.empty())
+        return found;
+    if (named.size() >= kIdentifierStart)
+        if (auto found = chosen([&](const CXListing& l) { return folded(l.uniqueId.str()).starts_with(wanted); });
+            !found.empty())
+            return found;
+    return chosen([&](const CXListing& l) { return folded(l.displayName).find(wanted) != std::string::npos; });
+}
+
+UniqueId only(const std::vector<CXListing>& found, const std::string& kind, const std::string& named) {
+    if (found.size() == 1) return found.front().uniqueId;
+    if (found.empty())
+        throw CommandError(kNotFound, fmt::format("There is no {} \"{}\". `rolvane {}` lists what there is.", kind,
+                                                  named, kind == "group" ? "group list" : "list"));
+    constexpr size_t kShown = 10;
+    std::string list;
+    for (size_t i = 0; i < std::min(found.size(), kShown); ++i)
+        list += fmt::format("\n  {}  {}", found[i].uniqueId.str(), found[i].displayName);
+    if (found.size() > kShown) list += fmt::format("\n  and {} more", found.size() - kShown);
+    throw CommandError(
+        kNotFound, fmt::format("\"{}\" fits {} {}s. Name one by its identifier:{}", named, found.size(), kind, list));
+}
+
+} // namespace
+
+CXPersonRef findPerson(CXRolvane& database, const std::string& named) {
+    if (auto exact = std::dynamic_pointer_cast<CXPerson>(database.recordForUniqueId(UniqueId(named)))) return exact;
+    const UniqueId uid = only(matches(database.listPeople(std::nullopt), named), "person", named);
+    return std::dynamic_pointer_cast<CXPerson>(database.recordForUniqueId(uid));
+}
+
+CXGroupRef findGroup(CXRolvane& database, const std::string& named) {
+    if (auto exact = std::dynamic_pointer_cast<CXGroup>(database.recordForUniqueId(UniqueId(named)))) return exact;
+    const UniqueId uid = only(matches(database.listGroups(std::nullopt), named), "group", named);
+    return std::dynamic_pointer_cast<CXGroup>(database.recordForUniqueId(uid));
+}
+
+} // namespace rolvane::cli

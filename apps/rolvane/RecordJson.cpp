@@ -1,0 +1,164 @@
+#include "RecordJson.h"
+
+#include "contacts/Constants.h"
+
+#include <array>
+#include <fmt/format.h>
+
+namespace rolvane::cli {
+
+using Json = nlohmann::ordered_json;
+
+std::string base64(const Bytes& bytes) {
+    static constexpr char kDigits[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
+    std::string out;
+    out.reserve((bytes.size() + 2) / 3 * 4);
+    for (size_t i = 0; i < bytes.size(); i += 3) {
+        const size_t left = bytes.size() - i;
+        const uint32_t three = uint32_t(bytes[i]) << 16 | (left > 1 ? uint32_t(bytes[i + 1]) << 8 : 0) |
+                               (left > 2 ? uint32_t(bytes[i + 2]) : 0);
+        out += kDigits[three >> 18 & 63];
+        out += kDigits[three >> 12 & 63];
+        out += left > 1 ? kDigits[three >> 6 & 63] : '=';
+        out += left > 2 ? kDigits[three & 63] : '=';
+    }
+    return out;
+}
+
+Json toJson(const Value& value) {
+    switch (value.type()) {
+    case ValueType::absent: return nullptr;
+    case ValueType::boolean: return value.boolean();
+    case ValueType::integer: return value.integer();
+    case ValueType::real: return value.real();
+    case ValueType::string: return value.string();
+    case ValueType::date: return value.date()->toISO8601();
+    case ValueType::data: return base64(value.data());
+    case ValueType::array: {
+        Json array = Json::array();
+        for (const Value& item : *value.arrayIf()) array.push_back(toJson(item));
+        return array;
+    }
+    case ValueType::dictionary: {
+        Json object = Json::object();
+        for (const auto& [key, item] : *value.dictionaryIf()) object[key] = toJson(item);
+        return object;
+    }
+    }
+    return nullptr;
+}
+
+namespace {
+
+Json locationOf(const CXRecord& record) {
+    return record.remoteLocation().empty() ? Json() : Json(record.remoteLocation().str());
+}
+
+Json identifiers(const std::vector<UniqueId>& uids) {
+    Json list = Json::array();
+    for (const UniqueId& uid : uids) list.push_back(uid.str());
+    return list;
+}
+
+} // namespace
+
+Json toJson(CXPerson& person) {
+    Json groups = Json::array();
+    for (const CXGroupRef& group : person.parentGroups()) groups.push_back(group->name());
+    return {{"identifier", person.uniqueId().str()},
+            {"name", person.displayName()},
+            {"location", locationOf(person)},
+            {"created", toJson(person.valueForProperty(kCXCreationDateProperty))},
+            {"modified", toJson(person.valueForProperty(kCXModificationDateProperty))},
+            {"groups", groups},
+            {"properties", toJson(Value(person.dictionaryRepresentation()))}};
+}
+
+Json toJson(CXGroup& group) {
+    Json choices = Json::object();
+    for (const auto& [person, chosen] : group.distributionChoices())
+        for (const auto& [property, identifier] : chosen) choices[person.str()][property] = identifier;
+    Json published = Json::array();
+    if (const auto locations = group.multiValueForProperty(kCXRemoteLocationProperty))
+        for (const CXMultiValue::Entry& entry : locations->entries())
+            if (entry.label == kCXPublishLabel) published.push_back(entry.value.string());
+    return {{"identifier", group.uniqueId().str()},
+            {"name", group.name()},
+            {"location", locationOf(group)},
+            {"published", published},
+            {"members", identifiers(group.memberUniqueIds())},
+            {"subgroups", identifiers(group.subgroupUniqueIds())},
+            {"distribution", choices}};
+}
+
+namespace {
+
+constexpr std::array<std::pair<const char*, const char*>, 14> kSingles{{
+    {kCXTitleProperty, "Title"},
+    {kCXNicknameProperty, "Nickname"},
+    {kCXMaidenNameProperty, "Maiden name"},
+    {kCXFirstNamePhoneticProperty, "First, phonetic"},
+    {kCXLastNamePhoneticProperty, "Last, phonetic"},
+    {kCXOrganizationProperty, "Organisation"},
+    {kCXDepartmentProperty, "Department"},
+    {kCXJobTitleProperty, "Job title"},
+    {kCXBirthdayProperty, "Birthday"},
+    {kCXBirthdayTextProperty, "Birthday"},
+    {kCXHomePageProperty, "Home page"},
+    {kCXCategoriesProperty, "Categories"},
+    {kCXPhotoProperty, "Photo"},
+    {kCXNoteProperty, "Note"},
+}};
+constexpr std::array<const char*, 7> kMultis{kCXPhoneProperty,     kCXEmailProperty,          kCXAddressProperty,
+                                             kCXURLsProperty,      kCXInstantMessageProperty, kCXRelatedNamesProperty,
+                                             kCXOtherDatesProperty};
+
+std::string oneLine(const Value& value) {
+    if (const Dictionary* parts = value.dictionaryIf()) {
+        std::string text;
+        for (const char* key : {kCXAddressPOBoxKey, kCXAddressExtendedKey, kCXAddressStreetKey, kCXAddressZIPKey,
+                                kCXAddressCityKey, kCXAddressStateKey, kCXAddressCountryKey})
+            if (const std::string& part = (*parts)[key].string(); !part.empty())
+                text += (text.empty() ? "" : ", ") + part;
+        return text.empty() ? value.description() : text;
+    }
+    if (const Array* list = value.arrayIf()) {
+        std::string text;
+        for (const Value& item : *list) text += (text.empty() ? "" : ", ") + oneLine(item);
+        return text;
+    }
+    if (value.isData()) return fmt::format("{} bytes", value.data().size());
+    if (value.isDate()) return value.date()->toISO8601().substr(0, 10);
+    return value.description();
+}
+
+void addLine(std::string& text, const std::string& label, const std::string& value) {
+    std::string shown;
+    for (const char c : value) {
+        shown += c;
+        if (c == '\n') shown += std::string(18, ' ');
+    }
+    text += fmt::format("{:<18}{}\n", label, shown);
+}
+
+} // namespace
+
+std::string personText(CXPerson& person) {
+    std::string text = person.displayName() + "\n";
+    addLine(text, "Identifier", person.uniqueId().str());
+    if (!person.remoteLocation().empty()) addLine(text, "From", person.remoteLocation().str());
+    for (const auto& [property, label] : kSingles)
+        if (const Value value = person.valueForProperty(property)) addLine(text, label, oneLine(value));
+    for (const char* property : kMultis)
+        if (const auto values = person.multiValueForProperty(property))
+            for (const CXMultiValue::Entry& entry : values->entries())
+                addLine(text, entry.label.empty() ? property : fmt::format("{} ({})", property, entry.label),
+                        oneLine(entry.value));
+    std::string groups;
+    for (const CXGroupRef& group : person.parentGroups()) groups += (groups.empty() ? "" : ", ") + group->name();
+    if (!groups.empty()) addLine(text, "Groups", groups);
+    text.pop_back();
+    return text;
+}
+
+} // namespace rolvane::cli

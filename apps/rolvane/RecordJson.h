@@ -1,0 +1,22 @@
+#pragma once
+
+#include "contacts/CXRolvane.h"
+#include "foundation/Value.h"
+
+#include <nlohmann/json.hpp>
+
+namespace rolvane::cli {
+
+// A value as JSON: data in base64, dates as RFC 3339 text, an absent value as null. Text that is not UTF-8 is mended.
+nlohmann::ordered_json toJson(const Value& value);
+std::string base64(const Bytes& bytes);
+
+// A person whole: identifier, name, location (subscribed ones), dates, groups, all properties.
+nlohmann::ordered_json toJson(CXPerson& person);
+// A group whole: identifier, name, location, members, subgroups, distribution choices, what it is published at.
+nlohmann::ordered_json toJson(CXGroup& group);
+
+// A person as lines for people.
+std::string personText(CXPerson& person);
+
+} // namespace rolvane::cli
