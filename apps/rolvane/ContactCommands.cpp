@@ -1,7 +1,306 @@
 #include "Context.h"
+#include "Lookup.h"
+#include "PersonFields.h"
+#include "RecordJson.h"
+
+#include "contacts/VCardExport.h"
+#include "contacts/VCardImport.h"
+
+#include <cerrno>
+#include <cstring>
+#include <fmt/format.h>
+#include <fstream>
+#include <iostream>
 
 namespace rolvane::cli {
 
-void addContactCommands(CLI::App&, Context&) {}
+namespace {
+
+using Json = nlohmann::ordered_json;
+
+// A copy that came by a subscription belongs to somebody else; without the right to write it cannot be changed here.
+void refuseReadOnly(CXRecord& record, const std::string& name) {
+    if (!record.isSubscribed()) return;
+    const CXAllGroupRef all = record.rolvane()->allGroupForRemoteLocation(record.remoteLocation());
+    const auto writers = all ? all->multiValueForProperty(kCXReadWriteSharingACLProperty) : std::nullopt;
+    if (writers && !writers->empty()) return;
+    throw CommandError(kRefused, fmt::format("\"{}\" is a copy from {}, which may be read but not changed. Ask its "
+                                             "owner for the right to write.",
+                                             name, record.remoteLocation().str()));
+}
+
+// import ---------------------------------------------------------------------------------------------------------
+
+struct ImportOptions {
+    std::vector<std::string> files;
+    std::string group;
+};
+
+Json importReport(const VCardImportReport& report) {
+    Json errors = Json::array();
+    for (const VCardError& error : report.errors)
+        errors.push_back({{"file", error.file}, {"line", error.line}, {"reason", error.reason}});
+    return {{"imported", report.imported},
+            {"updated", report.updated},
+            {"unchanged", report.unchanged},
+            {"groups", report.groups},
+            {"missingMembers", report.missingMembers},
+            {"bad", report.errorCount},
+            {"errors", errors}};
+}
+
+void importCards(Context& context, const ImportOptions& options) {
+    VCardImportReport report;
+    {
+        ProgressBar bar(context, "Importing");
+        VCardImport import(context.database(), [&](const VCardProgress& progress) {
+            if (progress.bytesTotal > 0)
+                bar.update(static_cast<double>(progress.bytesDone) / static_cast<double>(progress.bytesTotal),
+                           fmt::format("{} contacts", progress.cards));
+        });
+        for (const std::string& file : options.files)
+            if (file == "-")
+                import.addStream(std::cin, "standard input");
+            else
+                import.addFile(file);
+        report = import.finish();
+    }
+    for (const VCardError& error : report.errors)
+        context.warn(fmt::format("{}:{}: {}", error.file, error.line, error.reason));
+    if (report.errorCount > report.errors.size())
+        context.warn(fmt::format("and {} more bad cards", report.errorCount - report.errors.size()));
+    if (context.json)
+        context.print(importReport(report));
+    else
+        context.say(fmt::format("{} imported, {} updated, {} unchanged, {} groups, {} bad cards left out.",
+                                report.imported, report.updated, report.unchanged, report.groups, report.errorCount));
+    if (report.errorCount > 0)
+        context.exitCode = report.imported + report.updated + report.unchanged + report.groups > 0 ? kPartly : kFailed;
+}
+
+// export ---------------------------------------------------------------------------------------------------------
+
+struct ExportOptions {
+    std::string group, output, version = "4";
+    std::vector<std::string> names;
+};
+
+size_t exportTo(Context& context, const ExportOptions& options, std::ostream& out) {
+    CXRolvane& database = context.database();
+    ProgressBar bar(context, "Exporting");
+    VCardExport writer(database, out, options.version == "3" ? VCardVersion::v3 : VCardVersion::v4,
+                       [&](size_t done, size_t total) {
+                           if (total > 1000) bar.update(static_cast<double>(done) / static_cast<double>(total));
+                       });
+    if (!options.group.empty()) return writer.exportGroup(findGroup(database, options.group));
+    if (options.names.empty()) return writer.exportAll();
+    std::vector<UniqueId> uids;
+    for (const std::string& name : options.names) uids.push_back(findPerson(database, name)->uniqueId());
+    return writer.exportRecords(uids);
+}
+
+void exportCards(Context& context, const ExportOptions& options) {
+    size_t cards = 0;
+    if (options.output.empty() || options.output == "-") {
+        cards = exportTo(context, options, std::cout);
+    } else {
+        std::ofstream file(options.output, std::ios::binary | std::ios::trunc);
+        if (!file)
+            throw CommandError(kFailed,
+                               fmt::format("{} cannot be written ({}).", options.output, std::strerror(errno)));
+        cards = exportTo(context, options, file);
+        file.close();
+        if (!file)
+            throw CommandError(kFailed,
+                               fmt::format("{} could not be written whole. Is the disk full?", options.output));
+    }
+    context.say(fmt::format("{} cards written.", cards));
+}
+
+// list and show ----------------------------------------------------------------------------------------------------
+
+struct ListOptions {
+    std::string text, group;
+    bool full = false;
+};
+
+std::vector<CXListing> chosenPeople(Context& context, const ListOptions& options) {
+    CXRolvane& database = context.database();
+    std::vector<CXListing> people = database.listPeople(std::nullopt, options.text);
+    if (options.group.empty()) return people;
+    const auto members = findGroup(database, options.group)->memberUniqueIds();
+    const std::set<UniqueId> wanted(members.begin(), members.end());
+    std::erase_if(people, [&](const CXListing& person) { return !wanted.contains(person.uniqueId); });
+    return people;
+}
+
+void list(Context& context, const ListOptions& options) {
+    const std::vector<CXListing> people = chosenPeople(context, options);
+    if (!context.json) {
+        for (const CXListing& person : people)
+            context.line(fmt::format("{}  {}{}", person.uniqueId.str(), person.displayName,
+                                     person.location.empty() ? "" : "  [" + person.location.str() + "]"));
+        return;
+    }
+    // Written one by one: a document of 100,000 people with photos need not stand in memory.
+    context.line("[");
+    for (size_t i = 0; i < people.size(); ++i) {
+        Json data;
+        if (options.full) {
+            const auto person =
+                std::dynamic_pointer_cast<CXPerson>(context.database().recordForUniqueId(people[i].uniqueId));
+            if (!person) continue;
+            data = toJson(*person);
+        } else {
+            data = {{"identifier", people[i].uniqueId.str()},
+                    {"name", people[i].displayName},
+                    {"location", people[i].location.empty() ? Json() : Json(people[i].location.str())}};
+        }
+        context.line("  " + data.dump(-1, ' ', false, Json::error_handler_t::replace) +
+                     (i + 1 < people.size() ? "," : ""));
+    }
+    context.line("]");
+}
+
+void show(Context& context, const std::vector<std::string>& names) {
+    Json all = Json::array();
+    for (size_t i = 0; i < names.size(); ++i) {
+        const CXPersonRef person = findPerson(context.database(), names[i]);
+        if (context.json)
+            all.push_back(toJson(*person));
+        else
+            context.line((i > 0 ? "\n" : "") + personText(*person));
+    }
+    if (context.json) context.print(all.size() == 1 ? all[0] : all);
+}
+
+// add, edit, delete ------------------------------------------------------------------------------------------------
+
+void tell(Context& context, CXPerson& person, const std::string& done) {
+    if (context.json)
+        context.print({{"identifier", person.uniqueId().str()}, {"name", person.displayName()}});
+    else
+        context.line(person.uniqueId().str());
+    context.say(fmt::format("{} {}.", person.displayName(), done));
+}
+
+void add(Context& context, const PersonFields& fields, const std::vector<std::string>& groups) {
+    CXRolvane& database = context.database();
+    std::vector<CXGroupRef> joined;
+    for (const std::string& group : groups) joined.push_back(findGroup(database, group));
+    const CXPersonRef person = CXPerson::create();
+    fields.applyTo(*person);
+    if (person->cxUsedProperties().empty())
+        throw CommandError(kUsage, "A contact needs at least one of the options that `rolvane add --help` lists.");
+    database.addRecord(person);
+    for (const CXGroupRef& group : joined) group->addMember(person);
+    database.save();
+    tell(context, *person, "added");
+}
+
+void edit(Context& context, const std::string& name, const PersonFields& fields) {
+    const CXPersonRef person = findPerson(context.database(), name);
+    refuseReadOnly(*person, person->displayName());
+    fields.applyTo(*person);
+    const bool changed = context.database().hasUnsavedChanges();
+    context.database().save();
+    tell(context, *person, changed ? "changed" : "stays as it was");
+}
+
+bool confirmed(Context& context, const std::string& question) {
+    if (!::isatty(STDIN_FILENO)) return true;
+    std::cerr << question << " [y/N] " << std::flush;
+    std::string answer;
+    std::getline(std::cin, answer);
+    if (answer == "y" || answer == "Y" || answer == "yes") return true;
+    context.say("Nothing was deleted.");
+    return false;
+}
+
+void remove(Context& context, const std::vector<std::string>& names, bool yes) {
+    CXRolvane& database = context.database();
+    std::vector<CXPersonRef> people;
+    for (const std::string& name : names) {
+        people.push_back(findPerson(database, name));
+        refuseReadOnly(*people.back(), people.back()->displayName());
+    }
+    const std::string question = people.size() == 1 ? fmt::format("Delete {}?", people[0]->displayName())
+                                                    : fmt::format("Delete {} people?", people.size());
+    if (!yes && !confirmed(context, question)) return;
+    for (const CXPersonRef& person : people) database.removeRecord(person);
+    database.save();
+    context.say(people.size() == 1 ? "1 person deleted." : fmt::format("{} people deleted.", people.size()));
+}
+
+} // namespace
+
+void addContactCommands(CLI::App& app, Context& context) {
+    const auto imports = std::make_shared<ImportOptions>();
+    addCommand(
+        app, context, "import", "Take contacts and groups from vCard files",
+        [&](CLI::App& command) {
+            command.add_option("files", imports->files, "vCard files (3.0 or 4.0); - reads standard input")->required();
+        },
+        [&context, imports] { importCards(context, *imports); });
+
+    const auto exports = std::make_shared<ExportOptions>();
+    addCommand(
+        app, context, "export", "Write contacts and groups as vCards",
+        [&](CLI::App& command) {
+            command.add_option("names", exports->names, "People, by name or identifier; without any, everything");
+            command.add_option("-g,--group", exports->group, "The members of this group, and its subgroups");
+            command.add_option("-o,--output", exports->output, "File to write; without it, standard output");
+            command.add_option("--vcard", exports->version, "vCard version, 3 or 4")
+                ->check(CLI::IsMember({"3", "4"}))
+                ->capture_default_str();
+        },
+        [&context, exports] { exportCards(context, *exports); });
+
+    const auto lists = std::make_shared<ListOptions>();
+    addCommand(
+        app, context, "list", "List people",
+        [&](CLI::App& command) {
+            command.add_option("text", lists->text, "Only those with this text in name, organisation, mail or phone");
+            command.add_option("-g,--group", lists->group, "Only members of this group");
+            command.add_flag("--full", lists->full, "With --json: every property");
+        },
+        [&context, lists] { list(context, *lists); });
+
+    const auto shown = std::make_shared<std::vector<std::string>>();
+    addCommand(
+        app, context, "show", "Show people with all they have",
+        [&](CLI::App& command) { command.add_option("names", *shown, "Names or identifiers")->required(); },
+        [&context, shown] { show(context, *shown); });
+
+    const auto added = std::make_shared<PersonFields>();
+    const auto groups = std::make_shared<std::vector<std::string>>();
+    addCommand(
+        app, context, "add", "Add a person; prints the identifier",
+        [&](CLI::App& command) {
+            added->declare(command, false);
+            command.add_option("-g,--group", *groups, "Make the person a member of this group");
+        },
+        [&context, added, groups] { add(context, *added, *groups); });
+
+    const auto edited = std::make_shared<PersonFields>();
+    const auto named = std::make_shared<std::string>();
+    addCommand(
+        app, context, "edit", "Change a person; an empty text takes a field away",
+        [&](CLI::App& command) {
+            command.add_option("name", *named, "Name or identifier")->required();
+            edited->declare(command, true);
+        },
+        [&context, edited, named] { edit(context, *named, *edited); });
+
+    const auto deleted = std::make_shared<std::vector<std::string>>();
+    const auto yes = std::make_shared<bool>(false);
+    addCommand(
+        app, context, "delete", "Delete people",
+        [&](CLI::App& command) {
+            command.add_option("names", *deleted, "Names or identifiers")->required();
+            command.add_flag("-y,--yes", *yes, "Do not ask");
+        },
+        [&context, deleted, yes] { remove(context, *deleted, *yes); });
+}
 
 } // namespace rolvane::cli
