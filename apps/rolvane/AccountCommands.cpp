@@ -1,7 +1,167 @@
 #include "Context.h"
+#include "Terminal.h"
+
+#include "daemon/DaemonControl.h"
+#include "foundation/Paths.h"
+#include "store/CXDAVManager.h"
+
+#include <fmt/format.h>
 
 namespace rolvane::cli {
 
-void addAccountCommands(CLI::App&, Context&) {}
+namespace {
+
+using Json = nlohmann::ordered_json;
+
+struct AccountOptions {
+    std::string user, endpoint, host, caFile, authentication = "automatic";
+    std::string passwordCommand, passwordCredential, passwordFile;
+    bool askPassword = false, noPassword = false, plainLoopback = false, store = false;
+};
+
+std::string passwordPath() {
+    return configDirectory() + "/password";
+}
+
+Authentication authenticationNamed(const std::string& name) {
+    return name == "basic"    ? Authentication::basic
+           : name == "digest" ? Authentication::digest
+                              : Authentication::automatic;
+}
+
+PasswordSource passwordSource(const AccountOptions& options, const PasswordSource& former, const std::string& user) {
+    using Kind = PasswordSource::Kind;
+    if (options.noPassword) return {Kind::none, {}};
+    if (!options.passwordCommand.empty()) return {Kind::command, options.passwordCommand};
+    if (!options.passwordCredential.empty()) return {Kind::credential, options.passwordCredential};
+    if (!options.passwordFile.empty()) return {Kind::file, options.passwordFile};
+    if (!options.askPassword) return former;
+    const std::string password = readSecret("Password of " + user + ": ");
+    if (password.empty()) throw CommandError(kUsage, "The password is empty. Nothing was changed.");
+    writeFileDurably(passwordPath(), password + "\n", 0600);
+    return {Kind::file, passwordPath()};
+}
+
+std::optional<CXDAVAccount> savedAccount() {
+    return CXDAVAccount::load();
+}
+
+void setAccount(Context& context, CLI::App& command, const AccountOptions& options) {
+    CXDAVAccount account;
+    if (const auto saved = savedAccount()) account = *saved;
+    const std::string formerUser = account.user.str();
+    const auto given = [&](const char* option) { return command.get_option(option)->count() > 0; };
+    if (given("--user")) account.user = UserName(options.user);
+    if (given("--endpoint")) account.endpoint = options.endpoint;
+    if (given("--host")) account.nameHost = options.host;
+    if (given("--ca-file")) account.caFile = options.caFile;
+    if (given("--authentication")) account.authentication = authenticationNamed(options.authentication);
+    if (given("--plain-loopback")) account.plainLoopback = options.plainLoopback;
+    if (account.user.empty()) throw CommandError(kUsage, "Name the user with --user.");
+    account.passwordSource = passwordSource(options, account.passwordSource, account.user.str());
+    if (const auto problem = account.problem()) throw CommandError(kUsage, *problem);
+    account.save();
+    context.say(fmt::format("The account of {} at {} is saved. `rolvane account test` tries it.", account.user.str(),
+                            account.endpoint));
+    if (const DaemonControl daemon; daemon.running()) {
+        daemon.restart(); // it reads the account once
+        context.say("RolvaneManager was started anew with it.");
+    }
+    if (!formerUser.empty() && formerUser != account.user.str())
+        context.say("The account's user is another one than before: the next pass starts from nothing and compares "
+                    "everything.");
+}
+
+const char* sourceName(PasswordSource::Kind kind) {
+    switch (kind) {
+    case PasswordSource::Kind::none: return "none";
+    case PasswordSource::Kind::command: return "command";
+    case PasswordSource::Kind::credential: return "credential";
+    case PasswordSource::Kind::file: return "file";
+    }
+    return "none";
+}
+
+void showAccount(Context& context) {
+    const auto account = savedAccount();
+    if (!account) throw CommandError(kNotFound, "There is no account on a store yet. `rolvane account set` makes one.");
+    const char* authentication = account->authentication == Authentication::basic    ? "basic"
+                                 : account->authentication == Authentication::digest ? "digest"
+                                                                                     : "automatic";
+    const Json data{
+        {"user", account->user.str()},
+        {"endpoint", account->endpoint},
+        {"host", account->effectiveNameHost()},
+        {"location", account->baseLocationFor(account->user).absoluteString()},
+        {"authentication", authentication},
+        {"password", {{"source", sourceName(account->passwordSource.kind)}, {"value", account->passwordSource.value}}},
+        {"caFile", account->caFile},
+        {"plainLoopback", account->plainLoopback}};
+    if (context.json) return context.print(data);
+    context.line(fmt::format("{:<15}{}", "User", account->user.str()));
+    context.line(fmt::format("{:<15}{}", "Endpoint", account->endpoint));
+    context.line(fmt::format("{:<15}{}", "Location", data["location"].get<std::string>()));
+    context.line(fmt::format("{:<15}{}", "Sign-in", authentication));
+    context.line(fmt::format("{:<15}{} {}", "Password", sourceName(account->passwordSource.kind),
+                             account->passwordSource.value));
+    if (!account->caFile.empty()) context.line(fmt::format("{:<15}{}", "Authority", account->caFile));
+    if (account->plainLoopback) context.line(fmt::format("{:<15}{}", "Transport", "plain http on this machine"));
+}
+
+// Signs in and looks whether the tree is there. Exit code 5 for a refused login, 6 for a store that is not reached.
+void testAccount(Context& context) {
+    if (!savedAccount())
+        throw CommandError(kNotFound, "There is no account on a store yet. `rolvane account set` makes one.");
+    CXDAVError error;
+    const bool reachable = CXDAVManager::canReachOstrelError(error);
+    const bool structure = reachable && CXDAVManager::defaultManager().sanityCheckPublishStructureCreate(false);
+    if (context.json)
+        context.print({{"reachable", reachable},
+                       {"code", error.code},
+                       {"reason", reachable ? Json() : Json(error.reason)},
+                       {"published", structure}});
+    if (!reachable) {
+        const bool refused = error.code == kCXDAVErrorAuthentication;
+        throw CommandError(refused ? kRefused : kUnreachable,
+                           error.reason.empty() ? "The store's address cannot be reached from this machine now. Is the "
+                                                  "network up?"
+                                                : error.reason);
+    }
+    context.say(structure ? "The store can be used, and the account's tree is there."
+                          : "The store can be used; the account has no tree there yet.");
+}
+
+} // namespace
+
+void addAccountCommands(CLI::App& app, Context& context) {
+    CLI::App* account = addCommand(app, context, "account", "The account on the store", nullptr, nullptr);
+    account->require_subcommand(1);
+    const auto o = std::make_shared<AccountOptions>();
+    CLI::App* set = addCommand(
+        *account, context, "set", "Make or change the account; what is not given stays",
+        [&](CLI::App& c) {
+            c.add_option("--user", o->user, "User name on the store");
+            c.add_option("--endpoint", o->endpoint,
+                         "Where a user's tree is, such as https://dav.example.org/dav/{user}/Contacts");
+            c.add_option("--host", o->host, "Host in the names of locations; the endpoint's, unless given");
+            c.add_option("--ca-file", o->caFile, "PEM file of a private certificate authority");
+            c.add_option("--authentication", o->authentication, "automatic, basic or digest")
+                ->check(CLI::IsMember({"automatic", "basic", "digest"}));
+            auto* password = c.add_option_group("password", "Where the password comes from; it is never an argument");
+            password->add_flag("--ask-password", o->askPassword,
+                               "Ask for it (or read a line of standard input) and keep it in a file of mode 0600");
+            password->add_option("--password-command", o->passwordCommand, "Command whose first line of output it is");
+            password->add_option("--password-credential", o->passwordCredential, "Name of a systemd credential");
+            password->add_option("--password-file", o->passwordFile, "File of mode 0600");
+            password->add_flag("--no-password", o->noPassword, "The store asks for none");
+            password->require_option(0, 1);
+            c.add_flag("--plain-loopback,!--no-plain-loopback", o->plainLoopback,
+                       "The store speaks plain http, on this machine only");
+        },
+        nullptr);
+    set->final_callback([&context, o, set] { setAccount(context, *set, *o); });
+    addCommand(*account, context, "show", "Show the account", nullptr, [&context] { showAccount(context); });
+    addCommand(*account, context, "test", "Sign in to the store", nullptr, [&context] { testAccount(context); });
+}
 
 } // namespace rolvane::cli

@@ -1,7 +1,141 @@
 #include "Context.h"
+#include "Terminal.h"
+
+#include "server/PrivateStore.h"
+
+#include <fmt/format.h>
 
 namespace rolvane::cli {
 
-void addStoreCommands(CLI::App&, Context&) {}
+namespace {
+
+using Json = nlohmann::ordered_json;
+
+struct StoreOptions {
+    std::string directory, root, authentication = "basic", user;
+    int port = 0;
+    bool noTLS = false, noHTTP2 = false, now = false;
+};
+
+// The store as it was started last, so that later commands need only its directory.
+PrivateStoreOptions knownOptions(const StoreOptions& options) {
+    if (auto saved = PrivateStore::savedOptions(options.directory)) return *saved;
+    PrivateStoreOptions fresh;
+    fresh.stateDirectory = options.directory;
+    return fresh;
+}
+
+void tell(Context& context, const PrivateStore& store) {
+    const PrivateStoreStatus status = store.status();
+    const Json data{{"running", status.running},
+                    {"process", status.running ? Json(status.pid) : Json()},
+                    {"port", status.port ? Json(status.port) : Json()},
+                    {"url", status.port ? Json(store.baseURL()) : Json()},
+                    {"endpoint", status.port ? Json(store.endpointTemplate()) : Json()},
+                    {"caFile", store.caFile()},
+                    {"documents", store.documentRoot()},
+                    {"errorLog", store.errorLog()},
+                    {"users", store.users()}};
+    if (context.json) return context.print(data);
+    const auto row = [&](const char* label, const std::string& text) {
+        context.line(fmt::format("{:<15}{}", label, text));
+    };
+    row("Store", status.running ? fmt::format("running, process {}", status.pid) : "stopped");
+    if (status.port) row("Endpoint", store.endpointTemplate());
+    row("Authority", store.caFile());
+    row("Documents", store.documentRoot());
+    row("Log", store.errorLog());
+    std::string users;
+    for (const std::string& user : store.users()) users += (users.empty() ? "" : ", ") + user;
+    row("Users", users.empty() ? "none (`rolvane store user add`)" : users);
+}
+
+void start(Context& context, CLI::App& command, const StoreOptions& options) {
+    PrivateStoreOptions chosen = knownOptions(options);
+    const auto given = [&](const char* option) { return command.get_option(option)->count() > 0; };
+    if (given("--root")) chosen.documentRoot = options.root;
+    if (given("--port")) chosen.port = options.port;
+    if (given("--no-tls")) chosen.tls = !options.noTLS;
+    if (given("--no-http2")) chosen.http2 = !options.noHTTP2;
+    if (given("--authentication"))
+        chosen.authentication = options.authentication == "digest" ? StoreAuthentication::digest
+                                : options.authentication == "none" ? StoreAuthentication::none
+                                                                   : StoreAuthentication::basic;
+    PrivateStore store(chosen);
+    store.start();
+    tell(context, store);
+}
+
+void stop(Context& context, const StoreOptions& options) {
+    PrivateStore store(knownOptions(options));
+    const bool ran = store.status().running;
+    store.stop(options.now ? PrivateStore::Stop::atOnce : PrivateStore::Stop::gracefully);
+    context.say(ran ? "The store is stopped; its files stay." : "The store was not running.");
+}
+
+std::string newPassword(const std::string& user) {
+    const std::string password = readSecret("New password of " + user + ": ");
+    if (password.empty()) throw CommandError(kUsage, "The password is empty. Nothing was changed.");
+    return password;
+}
+
+} // namespace
+
+void addStoreCommands(CLI::App& app, Context& context) {
+    CLI::App* store = addCommand(app, context, "store", "A private store on this machine", nullptr, nullptr);
+    store->require_subcommand(1);
+    const auto o = std::make_shared<StoreOptions>();
+    const auto directory = [o](CLI::App& c) {
+        c.add_option("--directory", o->directory, "The store's own directory; several stores have one each");
+    };
+    CLI::App* startCommand = addCommand(
+        *store, context, "start", "Start it on a free loopback port; returns when it answers",
+        [&](CLI::App& c) {
+            directory(c);
+            c.add_option("--root", o->root, "Where the published files lie");
+            c.add_option("--port", o->port, "Port; the one of the last start, else a free one");
+            c.add_option("--authentication", o->authentication, "basic, digest or none")
+                ->check(CLI::IsMember({"basic", "digest", "none"}));
+            c.add_flag("--no-tls", o->noTLS, "Plain http");
+            c.add_flag("--no-http2", o->noHTTP2, "HTTP/1.1 only");
+        },
+        nullptr);
+    startCommand->final_callback([&context, o, startCommand] { start(context, *startCommand, *o); });
+    addCommand(
+        *store, context, "stop", "Stop it; the files stay",
+        [&](CLI::App& c) {
+            directory(c);
+            c.add_flag("--now", o->now, "Do not wait for requests under way");
+        },
+        [&context, o] { stop(context, *o); });
+    addCommand(*store, context, "status", "Tell whether it runs, and where (exit code 0 or 3)", directory,
+               [&context, o] {
+                   const PrivateStore known(knownOptions(*o));
+                   tell(context, known);
+                   if (!known.status().running) context.exitCode = kNotFound;
+               });
+    CLI::App* user = addCommand(*store, context, "user", "Users of the store", nullptr, nullptr);
+    user->require_subcommand(1);
+    const auto named = [&, directory, o](CLI::App& c) {
+        directory(c);
+        c.add_option("user", o->user, "User name")->required();
+    };
+    addCommand(*user, context, "add", "Add a user, or set a new password (asked for, or a line of standard input)",
+               named, [&context, o] {
+                   PrivateStore known(knownOptions(*o));
+                   known.addUser(o->user, newPassword(o->user));
+                   context.say(fmt::format("{} can sign in.", o->user));
+               });
+    addCommand(*user, context, "remove", "Take a user's account away; the files stay", named, [&context, o] {
+        if (!PrivateStore(knownOptions(*o)).removeUser(o->user))
+            throw CommandError(kNotFound, fmt::format("The store has no user {}.", o->user));
+        context.say(fmt::format("{} can no longer sign in.", o->user));
+    });
+    addCommand(*user, context, "list", "List the users", directory, [&context, o] {
+        const std::vector<std::string> users = PrivateStore(knownOptions(*o)).users();
+        if (context.json) return context.print(Json(users));
+        for (const std::string& name : users) context.line(name);
+    });
+}
 
 } // namespace rolvane::cli
