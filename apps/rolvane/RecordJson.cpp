@@ -1,6 +1,7 @@
 #include "RecordJson.h"
 
 #include "contacts/Constants.h"
+#include "foundation/Base64.h"
 
 #include <array>
 #include <fmt/format.h>
@@ -8,22 +9,6 @@
 namespace rolvane::cli {
 
 using Json = nlohmann::ordered_json;
-
-std::string base64(const Bytes& bytes) {
-    static constexpr char kDigits[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
-    std::string out;
-    out.reserve((bytes.size() + 2) / 3 * 4);
-    for (size_t i = 0; i < bytes.size(); i += 3) {
-        const size_t left = bytes.size() - i;
-        const uint32_t three = uint32_t(bytes[i]) << 16 | (left > 1 ? uint32_t(bytes[i + 1]) << 8 : 0) |
-                               (left > 2 ? uint32_t(bytes[i + 2]) : 0);
-        out += kDigits[three >> 18 & 63];
-        out += kDigits[three >> 12 & 63];
-        out += left > 1 ? kDigits[three >> 6 & 63] : '=';
-        out += left > 2 ? kDigits[three & 63] : '=';
-    }
-    return out;
-}
 
 Json toJson(const Value& value) {
     switch (value.type()) {
@@ -33,7 +18,11 @@ Json toJson(const Value& value) {
     case ValueType::real: return value.real();
     case ValueType::string: return value.string();
     case ValueType::date: return value.date()->toISO8601();
-    case ValueType::data: return base64(value.data());
+    case ValueType::data: {
+        std::string text;
+        appendBase64(value.data().data(), value.data().size(), text);
+        return text;
+    }
     case ValueType::array: {
         Json array = Json::array();
         for (const Value& item : *value.arrayIf()) array.push_back(toJson(item));

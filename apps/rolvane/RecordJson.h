@@ -9,7 +9,6 @@ namespace rolvane::cli {
 
 // A value as JSON: data in base64, dates as RFC 3339 text, an absent value as null. Text that is not UTF-8 is mended.
 nlohmann::ordered_json toJson(const Value& value);
-std::string base64(const Bytes& bytes);
 
 // A person whole: identifier, name, location (subscribed ones), dates, groups, all properties.
 nlohmann::ordered_json toJson(CXPerson& person);

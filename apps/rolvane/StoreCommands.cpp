@@ -14,7 +14,7 @@ using Json = nlohmann::ordered_json;
 struct StoreOptions {
     std::string directory, root, authentication = "basic", user;
     int port = 0;
-    bool noTLS = false, noHTTP2 = false, now = false;
+    bool noTLS = false, noHTTP2 = false, accessLog = false, now = false;
 };
 
 // The store as it was started last, so that later commands need only its directory.
@@ -57,6 +57,7 @@ void start(Context& context, CLI::App& command, const StoreOptions& options) {
     if (given("--port")) chosen.port = options.port;
     if (given("--no-tls")) chosen.tls = !options.noTLS;
     if (given("--no-http2")) chosen.http2 = !options.noHTTP2;
+    if (given("--access-log")) chosen.accessLog = options.accessLog;
     if (given("--authentication"))
         chosen.authentication = options.authentication == "digest" ? StoreAuthentication::digest
                                 : options.authentication == "none" ? StoreAuthentication::none
@@ -97,6 +98,8 @@ void addStoreCommands(CLI::App& app, Context& context) {
             c.add_option("--authentication", o->authentication, "basic, digest or none")
                 ->check(CLI::IsMember({"basic", "digest", "none"}));
             c.add_flag("--no-tls", o->noTLS, "Plain http");
+            c.add_flag("--access-log,!--no-access-log", o->accessLog,
+                       "Write a line for every request to logs/access.log");
             c.add_flag("--no-http2", o->noHTTP2, "HTTP/1.1 only");
         },
         nullptr);
