@@ -27,7 +27,7 @@ class Bus:
                 "<allow own='*'/></policy></busconfig>")
         self.process = subprocess.Popen(
             ["dbus-daemon", f"--config-file={config}", "--nofork", "--print-address=1"],
-            stdout=subprocess.PIPE, text=True)
+            stdout=subprocess.PIPE, stderr=subprocess.DEVNULL, text=True)
         self.address = self.process.stdout.readline().strip()
         if not self.address:
             raise Failure("the private session bus did not start")

@@ -170,6 +170,10 @@ void watch(Context& context, const WatchOptions& options) {
         std::fflush(stdout);
         std::cout.flush();
     };
+    if (context.json) {
+        context.line(Json{{"event", "watching"}}.dump()); // from here on nothing is missed
+        std::cout.flush();
+    }
     constexpr double kForever = 1e9;
     const bool ended = pass.waitUntil([&] { return interrupt.came() || (options.once && pass.stopped() > 0); },
                                       options.seconds > 0 ? options.seconds : kForever);

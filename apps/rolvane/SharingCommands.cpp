@@ -43,14 +43,22 @@ void reportResult(Context& context) {
     context.exitCode = reachable ? kFailed : kUnreachable;
 }
 
-// Draws the daemon's progress until the database's change has been through a pass.
-void waitForPass(Context& context, PassWatch& watch, int64_t position, double seconds) {
+// Draws the daemon's progress until what was saved at that position of the journal and that date has been through a
+// pass: the daemon has taken the journal up to there, and a pass has ended since. (A daemon that watches a database for
+// the first time takes the journal as read and scans the database instead; a pass that was under way when the change
+// was saved ends without it.)
+void waitForPass(Context& context, PassWatch& watch, int64_t position, Date saved, double seconds) {
     ProgressBar bar(context, "Publishing");
     watch.onEvent = [&](const PassWatch::Event& event) {
         if (event.kind == PassWatch::Event::Kind::progress) bar.update(event.fraction);
     };
     CXRolvane& database = context.database();
-    const bool done = watch.waitUntil([&] { return database.cursorPosition(kDaemonProgram) >= position; }, seconds);
+    const auto done = watch.waitUntil(
+        [&] {
+            const auto lastPass = Preferences::shared().get(kDaemonDomain, kCXDCXConduitLastSyncDate).date();
+            return lastPass && *lastPass > saved && database.cursorPosition(kDaemonProgram) >= position;
+        },
+        seconds);
     watch.onEvent = nullptr;
     if (!done)
         throw CommandError(kUnreachable, fmt::format("The daemon had not finished after {} seconds; it goes on by "
@@ -64,6 +72,8 @@ struct PublishOptions {
     double timeout = kPassSeconds;
 };
 
+void sync(Context& context, double seconds);
+
 void publish(Context& context, const PublishOptions& options) {
     const Url base = ownBase();
     CXRolvane& database = context.database();
@@ -75,12 +85,9 @@ void publish(Context& context, const PublishOptions& options) {
     const bool changed = group ? publication.publishGroup(group, base) : publication.publishEverything(base);
     database.save();
     const int64_t position = database.journalPosition();
+    const Date saved = Clock::system().now();
     const std::string what = group ? fmt::format("The group \"{}\"", group->name()) : "The contact list";
-    if (!changed) {
-        context.say(fmt::format("{} is published already at {}.", what, base.absoluteString()));
-    } else {
-        context.say(fmt::format("{} is published at {}.", what, base.absoluteString()));
-    }
+    context.say(fmt::format("{} is published{} at {}.", what, changed ? "" : " already", base.absoluteString()));
     if (options.noDaemon) return;
     // A daemon that started with nothing shared serves nothing: it decides when it starts.
     const DaemonControl daemon;
@@ -89,7 +96,8 @@ void publish(Context& context, const PublishOptions& options) {
     else
         daemon.start();
     if (options.noWait) return;
-    waitForPass(context, watch, position, options.timeout);
+    if (!changed) return sync(context, options.timeout);
+    waitForPass(context, watch, position, saved, options.timeout);
     reportResult(context);
     if (context.exitCode == kOk) context.say("Everything is on the store.");
 }
