@@ -218,11 +218,27 @@ std::vector<std::string> CXDAVAccount::origins() const {
     return out;
 }
 
-std::optional<Url> CXDAVAccount::endpointFor(const Url& name, bool securely) const {
-    const bool plain = endpoint.starts_with("http:");
-    const auto e = parsedTemplate(plain && securely ? secureEndpoint : endpoint);
+struct EndpointMap::Impl {
+    std::string nameHost;
+    std::optional<Endpoint> usual, secure;             // `secure` is `usual` unless that is plain
+    std::vector<std::pair<Endpoint, std::string>> all; // with their origins
+};
+
+EndpointMap::EndpointMap(const CXDAVAccount& account) : _impl(std::make_unique<Impl>()) {
+    _impl->nameHost = account.effectiveNameHost();
+    _impl->usual = parsedTemplate(account.endpoint);
+    const auto other = parsedTemplate(account.secureEndpoint);
+    _impl->secure = account.endpoint.starts_with("http:") ? other : _impl->usual;
+    for (const auto& e : {_impl->usual, other})
+        if (e) _impl->all.emplace_back(*e, originOf(*e));
+}
+
+EndpointMap::~EndpointMap() = default;
+
+std::optional<Url> EndpointMap::endpointFor(const Url& name, bool securely) const {
+    const auto& e = securely ? _impl->secure : _impl->usual;
     if (!e || !isHttp(name.scheme())) return std::nullopt;
-    if (strcasecmp(authorityOf(name).c_str(), effectiveNameHost().c_str()) != 0) return std::nullopt;
+    if (strcasecmp(authorityOf(name).c_str(), _impl->nameHost.c_str()) != 0) return std::nullopt;
     const auto segments = safeSegments(name.encodedPath());
     if (!segments || segments->size() < 2 || (*segments)[1] != "Contacts") return std::nullopt;
     std::string text = e->scheme + "://" + e->authority;
@@ -233,7 +249,7 @@ std::optional<Url> CXDAVAccount::endpointFor(const Url& name, bool securely) con
     return Url::parse(text);
 }
 
-std::optional<Url> CXDAVAccount::nameFor(std::string_view href) const {
+std::optional<Url> EndpointMap::nameFor(std::string_view href) const {
     std::string origin, path(href);
     if (!href.starts_with("/")) {
         const auto url = Url::parse(href);
@@ -245,18 +261,26 @@ std::optional<Url> CXDAVAccount::nameFor(std::string_view href) const {
     }
     const auto segments = safeSegments(path);
     if (!segments) return std::nullopt;
-    for (const std::string* text : {&endpoint, &secureEndpoint}) {
-        const auto e = parsedTemplate(*text);
-        if (!e || (!origin.empty() && origin != originOf(*e))) continue;
-        const size_t userAt = e->before.size(), rest = userAt + 1 + e->after.size();
-        if (segments->size() < rest || !std::equal(e->before.begin(), e->before.end(), segments->begin()) ||
-            !std::equal(e->after.begin(), e->after.end(), segments->begin() + static_cast<long>(userAt) + 1))
+    for (const auto& [e, itsOrigin] : _impl->all) {
+        if (!origin.empty() && origin != itsOrigin) continue;
+        const size_t userAt = e.before.size(), rest = userAt + 1 + e.after.size();
+        if (segments->size() < rest || !std::equal(e.before.begin(), e.before.end(), segments->begin()) ||
+            !std::equal(e.after.begin(), e.after.end(), segments->begin() + static_cast<long>(userAt) + 1))
             continue;
-        std::string name = baseLocationFor(UserName((*segments)[userAt])).absoluteString();
+        std::string name = "http://" + _impl->nameHost;
+        appendSegments(name, {(*segments)[userAt], "Contacts"});
         appendSegments(name, {segments->begin() + static_cast<long>(rest), segments->end()});
         return Url::parse(name);
     }
     return std::nullopt;
+}
+
+std::optional<Url> CXDAVAccount::endpointFor(const Url& name, bool securely) const {
+    return EndpointMap(*this).endpointFor(name, securely);
+}
+
+std::optional<Url> CXDAVAccount::nameFor(std::string_view href) const {
+    return EndpointMap(*this).nameFor(href);
 }
 
 } // namespace rolvane

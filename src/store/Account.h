@@ -4,6 +4,7 @@
 #include "foundation/Url.h"
 #include "foundation/Value.h"
 
+#include <memory>
 #include <optional>
 #include <string>
 #include <vector>
@@ -73,6 +74,21 @@ public:
     std::optional<Url> nameFor(std::string_view href) const;
 
     friend bool operator==(const CXDAVAccount&, const CXDAVAccount&) = default;
+};
+
+// The mapping of one account, taken apart once for many names. Any thread.
+class EndpointMap {
+public:
+    explicit EndpointMap(const CXDAVAccount& account);
+    ~EndpointMap();
+    EndpointMap(const EndpointMap&) = delete;
+    EndpointMap& operator=(const EndpointMap&) = delete;
+    std::optional<Url> endpointFor(const Url& name, bool securely) const; // as CXDAVAccount's
+    std::optional<Url> nameFor(std::string_view href) const;
+
+private:
+    struct Impl;
+    std::unique_ptr<Impl> _impl;
 };
 
 // True for "localhost", 127.0.0.0/8 and ::1, as written in a URL.

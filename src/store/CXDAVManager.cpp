@@ -32,6 +32,11 @@ std::string versionMemoryPath() {
     }
 }
 
+// What every name in the account's own tree begins with; without an account, what no name begins with.
+std::string treeOf(const CXDAVAccount& account) {
+    return account.user.empty() ? "\n" : account.baseLocationFor(account.user).absoluteString() + "/";
+}
+
 void setCode(int* code, int value) {
     if (code) *code = value;
 }
@@ -41,7 +46,7 @@ void setCode(int* code, int value) {
 CXDAVManager::Impl::Impl(CXDAVAccount account, std::shared_ptr<HttpTransport> transport, CurlTransport* signsIn,
                          std::string versionsPath)
     : versions(std::move(versionsPath)), session(std::move(account), std::move(transport), signsIn),
-      files(session, tokens, versions), structure(session, files) {}
+      files(session, tokens, versions), structure(session, files), ownTree(treeOf(session.account())) {}
 
 CXDAVManager::CXDAVManager(CXDAVAccount account) : CXDAVManager(std::move(account), VersionsFile()) {}
 
@@ -131,8 +136,7 @@ bool CXDAVManager::write(const std::string& text, const Url& url, bool securely)
 }
 
 bool CXDAVManager::write(const std::string& text, const Url& url, bool securely, int* code) {
-    const Url own = account().baseLocationFor(account().user);
-    const bool isOwn = url.absoluteString().starts_with(own.absoluteString() + "/");
+    const bool isOwn = url.absoluteString().starts_with(_impl->ownTree);
     const int status = _impl->files.write(
         url, text, securely, isOwn ? std::function<bool()>([this] { return _impl->structure.repair(); }) : nullptr);
     setCode(code, status);

@@ -20,6 +20,7 @@ struct CXDAVManager::Impl {
     StoreSession session;
     StoreFiles files;
     PublishStructure structure;
+    const std::string ownTree; // what every name below the account's own tree begins with
 };
 
 } // namespace rolvane

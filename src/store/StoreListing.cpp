@@ -62,11 +62,11 @@ std::vector<StoreListing::Members> StoreListing::members(const std::vector<Url>&
         if (answers[i].status != 207 || !staged[i]->sound) continue;
         const auto entries = staged[i]->reader.finish();
         if (!entries || entries->empty()) continue; // even an empty container names itself
-        const Url container = *_session.account().nameFor(_session.endpoint(containers[i])->absoluteString());
+        const Url container = *_session.nameFor(_session.endpoint(containers[i])->absoluteString());
         std::vector<std::pair<Url, MultistatusEntry>> inside;
         bool namesItself = false, whole = true;
         for (const MultistatusEntry& entry : *entries) {
-            const auto name = _session.account().nameFor(entry.href);
+            const auto name = _session.nameFor(entry.href);
             if (name && *name == container) {
                 namesItself = entry.isCollection;
                 continue;

@@ -56,10 +56,10 @@ std::unique_ptr<CurlTransport> makeAccountTransport(const CXDAVAccount& account)
 }
 
 StoreSession::StoreSession(CXDAVAccount account, std::shared_ptr<HttpTransport> transport, CurlTransport* signsIn)
-    : _account(std::move(account)), _transport(std::move(transport)), _signsIn(signsIn) {}
+    : _account(std::move(account)), _map(_account), _transport(std::move(transport)), _signsIn(signsIn) {}
 
 std::optional<Url> StoreSession::endpoint(const Url& name, bool securely) const {
-    return _account.endpointFor(name, securely);
+    return _map.endpointFor(name, securely);
 }
 
 HttpRequest StoreSession::request(std::string method, Url url) {

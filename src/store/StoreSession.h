@@ -27,6 +27,8 @@ public:
 
     // The endpoint of a name, or nothing.
     std::optional<Url> endpoint(const Url& name, bool securely = false) const;
+    // The name of an href, or nothing; both as CXDAVAccount's.
+    std::optional<Url> nameFor(std::string_view href) const { return _map.nameFor(href); }
 
     // Sends the request. A 403 or 404 is believed only from a WebDAV server: otherwise the answer is an `unreachable`.
     HttpResponse send(HttpRequest request);
@@ -48,6 +50,7 @@ private:
     CXDAVError errorFrom(const HttpResponse& answer, const char* asked) const;
 
     const CXDAVAccount _account;
+    const EndpointMap _map;
     const std::shared_ptr<HttpTransport> _transport;
     CurlTransport* const _signsIn; // gets the credentials; none when the transport has its own
 
