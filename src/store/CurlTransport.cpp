@@ -100,7 +100,7 @@ struct CurlTransport::Impl {
     void admit();
     bool heldBack(SteadyTime now);
     void launch(std::unique_ptr<HttpJob> job);
-    void reap();
+    bool reap(); // true when a transfer was complete
     void finished(CurlSlot& slot, CURLcode code);
     bool sendAgain(std::unique_ptr<HttpJob>& job);
     void checkDeadlines();
@@ -242,8 +242,10 @@ void CurlTransport::Impl::wait() {
         curlTimer.reset();
         curl_multi_socket_action(multi, CURL_SOCKET_TIMEOUT, 0, &running);
     }
+    // A timer may have completed a transfer; no socket would tell of it.
+    const bool completed = reap();
     sleeping = true;
-    int timeout = 60000;
+    int timeout = completed ? 0 : 60000;
     {
         std::lock_guard guard(inboxMutex);
         if (!inbox.empty()) timeout = 0;
@@ -338,7 +340,8 @@ void CurlTransport::Impl::launch(std::unique_ptr<HttpJob> job) {
         end(*slot, TransportError::unreachable, "The request could not be started.");
 }
 
-void CurlTransport::Impl::reap() {
+bool CurlTransport::Impl::reap() {
+    bool any = false;
     int left = 0;
     while (CURLMsg* message = curl_multi_info_read(multi, &left)) {
         if (message->msg != CURLMSG_DONE) continue;
@@ -346,7 +349,9 @@ void CurlTransport::Impl::reap() {
         CurlSlot* slot = nullptr;
         curl_easy_getinfo(message->easy_handle, CURLINFO_PRIVATE, &slot);
         finished(*slot, code);
+        any = true;
     }
+    return any;
 }
 
 void CurlTransport::Impl::detach(CurlSlot& slot) {
