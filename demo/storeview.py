@@ -12,6 +12,10 @@ import xml.etree.ElementTree as ElementTree
 DAV = "{DAV:}"
 
 
+class Unreadable(AssertionError):
+    """The store did not give what was asked for."""
+
+
 class StoreView:
     def __init__(self, endpoint, user, password, authority):
         url = urllib.parse.urlsplit(endpoint.replace("{user}", urllib.parse.quote(user)))
@@ -20,12 +24,13 @@ class StoreView:
         self.authorization = "Basic " + base64.b64encode(f"{user}:{password}".encode()).decode()
         self.connection = None
         self.requests = 0
+        self.patience = 20  # seconds for one answer; httpd may owe the rest of a file that goes while it is sent
 
     def request(self, method, path, headers=None):
         """(status, body); the connection is kept and made again when the server closed it."""
         for attempt in (1, 2):
             if self.connection is None:
-                self.connection = http.client.HTTPSConnection(self.host, self.port, context=self.context, timeout=20)
+                self.connection = http.client.HTTPSConnection(self.host, self.port, context=self.context, timeout=self.patience)
             try:
                 self.connection.request(method, path, headers={"Authorization": self.authorization, **(headers or {})})
                 answer = self.connection.getresponse()
@@ -46,8 +51,8 @@ class StoreView:
         status, body = self.request("GET", self.path(*parts))
         if status == 404:
             return None
-        if status != 200:
-            raise AssertionError(f"GET {'/'.join(parts)}: status {status}")
+        if status != 200:  # 403 is also what httpd says of a file that goes while it is being opened
+            raise Unreadable(f"GET {'/'.join(parts)}: status {status}")
         return plistlib.loads(body, fmt=plistlib.FMT_XML)
 
     def names(self, *parts):

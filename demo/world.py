@@ -113,9 +113,12 @@ def wait_until(test, seconds, what):
     """Asks again and again until the test gives something; fails with what the test said last."""
     end = time.monotonic() + seconds
     while True:
-        found, said = test()
-        if found:
+        try:
+            found, said = test()
+        except AssertionError as error:  # the store was not ready to answer; asked again
+            found, said = False, str(error)
+        if found and time.monotonic() <= end:
             return
         if time.monotonic() > end:
-            raise Failure(f"{what}: {said} after {seconds} seconds")
+            raise Failure(f"{what}: {'it took too long' if found else said} after {seconds} seconds")
         time.sleep(0.005)
