@@ -13,14 +13,19 @@ namespace rolvane {
 
 namespace {
 
-// Reads and forgets what is waiting on a descriptor; never blocks.
-void drain(int fd) {
+// Reads and forgets what is waiting on a descriptor; never blocks. False when nothing can come any more.
+bool drain(int fd) {
     char scratch[4096];
     for (;;) {
         const ssize_t n = ::read(fd, scratch, sizeof scratch);
         if (n > 0 || (n < 0 && errno == EINTR)) continue;
-        return;
+        return n < 0 && errno == EAGAIN;
     }
+}
+
+// A stream that its peer has closed would be ready for ever. (A datagram may be empty; that is no end.)
+bool endsWithItsPeer(int fd) {
+    return sd_is_fifo(fd, nullptr) > 0 || sd_is_socket(fd, AF_UNSPEC, SOCK_STREAM, 0) > 0;
 }
 
 // A message on demand: its only meaning is that the daemon is wanted, and it runs already.
@@ -59,18 +64,22 @@ CheckInPorts CXDCheckIn(RunLoop& loop) {
         const bool listening = sd_is_socket(fd, AF_UNSPEC, SOCK_STREAM, 1) > 0;
         if (!listening && sd_is_socket(fd, AF_UNSPEC, 0, -1) <= 0 && sd_is_fifo(fd, nullptr) <= 0) continue;
         makeNonBlocking(fd);
-        ports._sources.push_back(loop.addPort(fd, [fd, listening](uint32_t) {
+        const bool mayEnd = !listening && endsWithItsPeer(fd);
+        const auto source = std::make_shared<RunLoop::Handle>();
+        *source = loop.addPort(fd, [fd, listening, mayEnd, own = std::weak_ptr(source)](uint32_t) {
             if (listening)
                 drainListeningSocket(fd);
-            else
-                drain(fd);
-        }));
+            else if (!drain(fd) && mayEnd)
+                if (const auto held = own.lock()) held->reset();
+        });
+        ports._sources.push_back(source);
         ports._fromLauncher = true;
     }
     if (!ports._fromLauncher) {
         ports._idle = ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
         if (ports._idle >= 0)
-            ports._sources.push_back(loop.addPort(ports._idle, [fd = ports._idle](uint32_t) { drain(fd); }));
+            ports._sources.push_back(std::make_shared<RunLoop::Handle>(
+                loop.addPort(ports._idle, [fd = ports._idle](uint32_t) { drain(fd); })));
     }
     sd_notify(0, "READY=1");
     return ports;

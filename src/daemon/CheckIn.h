@@ -2,6 +2,7 @@
 
 #include "foundation/RunLoop.h"
 
+#include <memory>
 #include <vector>
 
 namespace rolvane {
@@ -19,7 +20,7 @@ public:
 
 private:
     friend CheckInPorts CXDCheckIn(RunLoop& loop);
-    std::vector<RunLoop::Handle> _sources;
+    std::vector<std::shared_ptr<RunLoop::Handle>> _sources; // an empty one: its peer has gone
     int _idle = -1;
     bool _fromLauncher = false;
 };

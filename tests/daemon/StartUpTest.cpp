@@ -1,0 +1,180 @@
+#include "DaemonWorld.h"
+
+#include "foundation/Paths.h"
+
+#include <fstream>
+
+namespace rolvane::test {
+namespace {
+
+constexpr const char* kPassStarted = "Sharing synchronization update started.";
+constexpr const char* kPassCompleted = "Sharing synchronization update completed.";
+constexpr double kAWhile = 0.3; // long enough for a timer of zero seconds to fire
+
+class StartUp : public testing::Test {
+protected:
+    DaemonWorld world;
+};
+
+TEST_F(StartUp, WithoutArgumentsItStays) {
+    const auto daemon = world.serving();
+    EXPECT_FALSE(daemon->wait(kAWhile)) << daemon->errors();
+    EXPECT_EQ(linesWith(daemon->errors(), "Parsing arguments."), 1U);
+    EXPECT_EQ(linesWith(daemon->errors(), "Checking in with kickerd."), 1U);
+}
+
+TEST_F(StartUp, PMakesItEndAsSoonAsItIsIdle) {
+    world.subscribeFarAway();
+    const auto daemon = world.serving({"-p"});
+    const auto ending = daemon->wait();
+    ASSERT_TRUE(ending);
+    EXPECT_TRUE(ending->exitedWith(0));
+    EXPECT_EQ(linesWith(daemon->errors(), kPassCompleted), 1U) << daemon->errors();
+    EXPECT_EQ(linesWith(daemon->errors(), "Killing RolvaneManager"), 1U) << daemon->errors();
+}
+
+TEST_F(StartUp, WithPAndNothingSharedItEndsWithoutAPass) {
+    world.setDebugLevel(1);
+    const auto daemon = world.startManager({"-p"});
+    const auto ending = daemon->wait();
+    ASSERT_TRUE(ending);
+    EXPECT_TRUE(ending->exitedWith(0));
+    EXPECT_EQ(linesWith(daemon->errors(), kPassStarted), 0U) << daemon->errors();
+    EXPECT_EQ(linesWith(daemon->errors(), "Killing RolvaneManager"), 1U) << daemon->errors();
+}
+
+TEST_F(StartUp, PTwiceIsOnce) {
+    world.subscribeFarAway();
+    const auto daemon = world.serving({"-p", "-p"});
+    const auto ending = daemon->wait();
+    ASSERT_TRUE(ending);
+    EXPECT_TRUE(ending->exitedWith(0));
+    EXPECT_EQ(linesWith(daemon->errors(), "Killing RolvaneManager"), 1U) << daemon->errors();
+}
+
+TEST_F(StartUp, PAmongUnknownArgumentsCountsAndTheyAreIgnored) {
+    world.subscribeFarAway();
+    const auto daemon = world.serving({"--frobnicate", "x", "-p", "-v"});
+    const auto ending = daemon->wait();
+    ASSERT_TRUE(ending);
+    EXPECT_TRUE(ending->exitedWith(0));
+    EXPECT_EQ(linesWith(daemon->errors(), "frobnicate"), 0U);
+    EXPECT_EQ(daemon->output(), "");
+}
+
+TEST_F(StartUp, OnlyTheExactArgumentMatches) {
+    const auto daemon = world.serving({"-P", "-px", "--p", "p", ""});
+    EXPECT_FALSE(daemon->wait(kAWhile)) << daemon->errors();
+}
+
+TEST_F(StartUp, WithNothingSharedThereIsNoPassYetTheLoopIsEntered) {
+    world.addPeople(3);
+    const auto daemon = world.serving();
+    EXPECT_EQ(linesWith(daemon->errors(), kPassStarted), 0U) << daemon->errors();
+    EXPECT_TRUE(daemon->running());
+}
+
+TEST_F(StartUp, ARemoteSubscriptionIsReasonForAPass) {
+    world.subscribeFarAway();
+    const auto daemon = world.serving();
+    EXPECT_EQ(linesWith(daemon->errors(), kPassStarted), 1U) << daemon->errors();
+    EXPECT_EQ(linesWith(daemon->errors(), kPassCompleted), 1U) << daemon->errors();
+}
+
+TEST_F(StartUp, WithPThePassIsDoneWhenTheProcessHasEnded) {
+    world.addPeople(30);
+    world.saveAccountOn(world.store());
+    world.publishEverything();
+    const auto daemon = world.startManager({"-p"});
+    const auto ending = daemon->wait();
+    ASSERT_TRUE(ending);
+    EXPECT_TRUE(ending->exitedWith(0)) << daemon->errors();
+    EXPECT_EQ(world.differences(), "");
+    EXPECT_EQ(world.pendingChanges(), 0U);
+}
+
+TEST_F(StartUp, AtDebugLevelZeroItIsSilent) {
+    world.addPeople(2);
+    world.saveAccountOn(world.store());
+    world.publishEverything();
+    const auto daemon = world.startManager({"-p"});
+    ASSERT_TRUE(daemon->wait());
+    EXPECT_EQ(daemon->errors(), "");
+    EXPECT_EQ(daemon->output(), "");
+}
+
+// What is there when the daemon starts and cannot be used: one line whatever the debug level, status 0, nothing
+// changed.
+void endsWithOneLineAbout(DaemonWorld& world, const std::string& path) {
+    const std::string before = readFile(path);
+    const auto daemon = world.startManager();
+    const auto ending = daemon->wait();
+    ASSERT_TRUE(ending) << daemon->errors();
+    EXPECT_TRUE(ending->exitedWith(0));
+    const std::string errors = daemon->errors();
+    EXPECT_EQ(linesWith(errors, "Quitting due to an unhandled exception: "), 1U) << errors;
+    EXPECT_EQ(linesWith(errors, ""), 1U) << "more than one line:\n" << errors;
+    EXPECT_EQ(linesWith(errors, path), 1U) << errors;
+    EXPECT_EQ(readFile(path), before);
+}
+
+TEST_F(StartUp, ADamagedDatabaseEndsItWithOneLineAndStatusZero) {
+    const std::string path = dataDirectory() + "/contacts.db";
+    std::ofstream(path) << "this is no database, and has never been one, however long one looks at it";
+    endsWithOneLineAbout(world, path);
+}
+
+TEST_F(StartUp, DamagedPreferencesEndItWithOneLineAndStatusZero) {
+    const std::string path = stateDirectory() + "/preferences.db";
+    std::ofstream(path) << "these are no preferences, and have never been any, however long one looks at them";
+    endsWithOneLineAbout(world, path);
+}
+
+TEST_F(StartUp, APasswordThatCannotBeHadEndsItWithStatusZero) {
+    world.addPeople(1);
+    world.saveAccountOn(world.store());
+    CXDAVAccount account = world.account();
+    account.passwordSource = {PasswordSource::Kind::command, "exit 1"};
+    account.save();
+    world.publishEverything();
+    const auto daemon = world.startManager();
+    const auto ending = daemon->wait();
+    ASSERT_TRUE(ending) << daemon->errors();
+    EXPECT_TRUE(ending->exitedWith(0)) << daemon->errors();
+    EXPECT_EQ(world.tree(), std::set<std::string>{});
+}
+
+TEST_F(StartUp, ASecondDaemonSaysThatOneRunsAndLeavesItAlone) {
+    const auto first = world.serving();
+    world.setDebugLevel(0);
+    const auto second = world.startManager({"-p"});
+    const auto ending = second->wait();
+    ASSERT_TRUE(ending);
+    EXPECT_TRUE(ending->exitedWith(0));
+    const std::string expected = "RolvaneManager is already running (process " + std::to_string(first->pid()) + ")";
+    EXPECT_EQ(linesWith(second->errors(), expected), 1U) << second->errors();
+    EXPECT_EQ(linesWith(second->errors(), ""), 1U) << second->errors();
+    EXPECT_TRUE(first->running());
+}
+
+TEST_F(StartUp, DaemonsOfTwoUsersDoNotMindEachOther) {
+    const auto first = world.serving();
+    DaemonWorld other;
+    const auto second = other.serving();
+    EXPECT_TRUE(first->running());
+    EXPECT_TRUE(second->running());
+}
+
+TEST_F(StartUp, AnEditOfAnotherProcessIsCarriedToTheStore) {
+    world.bus();
+    world.addPeople(2);
+    world.saveAccountOn(world.store());
+    world.publishEverything();
+    const auto daemon = world.serving();
+    world.addPeople(1, "Newcomer");
+    for (int i = 0; i < 200 && !world.differences().empty(); ++i) daemon->wait(0.05);
+    EXPECT_EQ(world.differences(), "") << daemon->errors();
+}
+
+} // namespace
+} // namespace rolvane::test
