@@ -56,13 +56,13 @@ bool CXRecord::setValue(Value value, std::string_view property) {
         if (value.isAbsent())
             _detached.remove(property);
         else
-            _detached.set(property, value.deepMutableCopy());
+            _detached.set(property, cxCarriableValue(value));
         return true;
     }
     CXRolvane* database = owner();
     if (!database) return false;
     std::lock_guard lock(database->impl().mutex);
-    return database->impl().setProperty(_uid, property, std::move(value));
+    return database->impl().setProperty(_uid, property, cxCarriableValue(value));
 }
 
 bool CXRecord::setValue(const CXMultiValue& value, std::string_view property) {

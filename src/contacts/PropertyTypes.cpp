@@ -2,6 +2,7 @@
 
 #include "contacts/CXRecord.h"
 #include "contacts/RecordKind.h"
+#include "foundation/Utf8.h"
 
 #include <algorithm>
 #include <array>
@@ -104,6 +105,41 @@ std::optional<CXPropertyType> cxPropertyType(std::string_view table, std::string
     return std::nullopt;
 }
 
+namespace {
+
+std::string carriable(const std::string& text) {
+    std::string kept;
+    for (std::string_view rest = text; !rest.empty();) {
+        const std::string_view before = rest;
+        const std::optional<char32_t> point = takeCodePoint(rest);
+        if (!point) {
+            appendUtf8(U'\uFFFD', kept);
+            rest.remove_prefix(1);
+        } else if (const auto one = before.substr(0, before.size() - rest.size()); !xmlTextFault(one)) {
+            kept.append(one);
+        }
+    }
+    return kept;
+}
+
+} // namespace
+
+Value cxCarriableValue(const Value& value) {
+    if (const std::string* text = value.stringIf()) return xmlTextFault(*text) ? Value(carriable(*text)) : value;
+    if (const Array* items = value.arrayIf()) {
+        Array copy;
+        for (const Value& item : *items) copy.append(cxCarriableValue(item));
+        return copy;
+    }
+    if (const Dictionary* entries = value.dictionaryIf()) {
+        Dictionary copy;
+        for (const auto& [key, item] : *entries)
+            copy.set(xmlTextFault(key) ? carriable(key) : key, cxCarriableValue(item));
+        return copy;
+    }
+    return value;
+}
+
 Dictionary cxSanitizedProperties(std::string_view table, const Dictionary& dictionary, bool skipUnknownProperties,
                                  bool generateMultiValueIDs) {
     Dictionary result;
@@ -115,10 +151,10 @@ Dictionary cxSanitizedProperties(std::string_view table, const Dictionary& dicti
         bool fits = !type || (isMulti(*type) ? isMultiValue : isOfType(value, *type));
         if (skipUnknownProperties && !fits) continue;
         if (isMultiValue && (!type || isMulti(*type)))
-            result.set(name,
-                       cleanMultiValue(value, skipUnknownProperties ? type : std::nullopt, generateMultiValueIDs));
+            result.set(name, cleanMultiValue(cxCarriableValue(value), skipUnknownProperties ? type : std::nullopt,
+                                             generateMultiValueIDs));
         else
-            result.set(name, value.deepMutableCopy());
+            result.set(name, cxCarriableValue(value));
     }
     return result;
 }

@@ -60,6 +60,28 @@ TEST(Record, WhatValueForPropertyGivesIsTheCallersOwn) {
     EXPECT_EQ(ada->valueForProperty(kCXCategoriesProperty), Value(Array{"a"}));
 }
 
+TEST(Record, TextThatAStoreCannotCarryIsKeptWithoutWhatItCannotCarry) {
+    TestDatabase d;
+    CXPersonRef ada = d.addPerson("Ada");
+    ada->setValue("a\x01"
+                  "b\tc\n\xff",
+                  kCXNoteProperty);
+    CXMutableMultiValue phones;
+    phones.addValue("1\x02"
+                    "2",
+                    "la\x03"
+                    "bel");
+    ada->setValue(phones, kCXPhoneProperty);
+    EXPECT_EQ(ada->valueForProperty(kCXNoteProperty), Value("ab\tc\n\uFFFD"));
+    EXPECT_EQ(ada->multiValueForProperty(kCXPhoneProperty)->valueAtIndex(0), Value("12"));
+    EXPECT_EQ(ada->multiValueForProperty(kCXPhoneProperty)->labelAtIndex(0), "label");
+    ada->resetWithDictionary({{kCXFirstNameProperty, "A\x04"
+                                                     "da"}},
+                             true, false);
+    EXPECT_EQ(ada->valueForProperty(kCXFirstNameProperty), Value("Ada"));
+    EXPECT_NO_THROW(PropertyList::toXML(ada->dictionaryRepresentation()));
+}
+
 TEST(Record, TwoLookupsGiveOneHandle) {
     TestDatabase d;
     CXPersonRef ada = d.addPerson("Ada");
