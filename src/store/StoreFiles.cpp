@@ -113,6 +113,9 @@ void StoreFiles::forget(const Url& url) {
 
 StoreFiles::Fetched StoreFiles::fetch(const Url& url, bool mayBeCollection) {
     HttpResponse answer = _session.send(StoreSession::request("GET", url));
+    // httpd says 403 of a file that is replaced or removed while it is being opened, too: only what is said twice
+    // counts.
+    if (answer.status == 403 && !mayBeCollection) answer = _session.send(StoreSession::request("GET", url));
     Fetched out;
     out.code = answer.status;
     if (!answer.complete()) return out;
@@ -163,9 +166,12 @@ StoreFiles::Fetched StoreFiles::fetchEither(const Url& url, Url& target) {
     }
     if (first.found == Found::perhapsCollection) {
         const Kind kind = kindOf(url);
-        if (kind != Kind::collection) return first;
-        remember(url);
-        target = state;
+        if (kind == Kind::file) return fetch(url, false);
+        if (kind == Kind::unknown) return first;
+        if (kind == Kind::collection) {
+            remember(url);
+            target = state;
+        }
     }
     return second;
 }

@@ -172,6 +172,29 @@ TEST_F(Publishing, AWriteAfterAFailedReadIsNotSent) {
     EXPECT_EQ(alice.read(kGroup).second, kState);
 }
 
+// httpd's own race: a file that goes while it is being opened is answered with 403.
+TEST_F(Publishing, AFileThatIsReplacedWhileItIsOpenedIsNotForbidden) {
+    ASSERT_TRUE(alice.manager.sanityCheckPublishStructureCreate(true));
+    const auto refuseOnce = [this] {
+        alice.wire->intercept([left = std::make_shared<int>(1)](const HttpRequest& r) {
+            return r.method == "GET" && (*left)-- > 0 ? std::optional(answerOf(403)) : std::nullopt;
+        });
+    };
+    refuseOnce();
+    EXPECT_EQ(alice.read("info").first, 200);
+
+    ASSERT_EQ(alice.write(kGroup, kState), 201);
+    refuseOnce();
+    EXPECT_EQ(alice.read(kGroup).second, kState);
+    EXPECT_EQ(alice.write(kGroup, kOther), 204) << "what was read is known";
+
+    alice.wire->intercept(nullptr);
+    ASSERT_TRUE(alice.manager.removeFileAtURL(alice.at(kGroup), nullptr));
+    refuseOnce();
+    EXPECT_EQ(alice.read(kGroup).first, 404) << alice.wire->text();
+    EXPECT_EQ(alice.write(kGroup, kState), 201);
+}
+
 TEST_F(Publishing, RemovingWhatIsAbsentSucceedsWithTheServersCode) {
     ASSERT_TRUE(alice.manager.sanityCheckPublishStructureCreate(true));
     int code = 0;
