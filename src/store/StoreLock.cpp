@@ -104,6 +104,11 @@ LockToken tokenInHeader(const HttpResponse& answer) {
     return LockToken(text->substr(1, text->size() - 2));
 }
 
+// True when the store has said what became of the lock; a server in trouble has not.
+bool settled(const HttpResponse& answer) {
+    return answer.complete() && answer.status != 401 && answer.status < 500;
+}
+
 bool isPlausible(const LockToken& token) {
     return !token.empty() && token.str().size() < 1024 && token.str().find_first_of("<>\r\n ") == std::string::npos;
 }
@@ -150,15 +155,32 @@ bool StoreLock::take(const HttpResponse& answer, const LockToken& known) {
     return true;
 }
 
-void StoreLock::lose() {
+// Without an answer the lock may still stand on the store: its token is kept for whoever asks next, the next run
+// included.
+void StoreLock::lose(bool storeAnswered) {
     LockToken token;
     {
         std::lock_guard guard(_mutex);
         std::swap(token, _token);
     }
     if (token.empty() || !_endpoint) return;
-    if (const auto client = _client.lock()) client->tokens.drop(_endpoint->absoluteString(), token);
-    _ledger.strike(_endpoint->absoluteString());
+    const std::string where = _endpoint->absoluteString();
+    if (const auto client = _client.lock())
+        storeAnswered ? client->tokens.drop(where, token) : client->tokens.abandon(where, token);
+    if (storeAnswered) _ledger.strike(where);
+}
+
+// Of a lock that stands on the store: perhaps it is ours, let go of without the store's hearing of it, or that of an
+// earlier run that did not come to release it.
+bool StoreLock::takeOver() {
+    const auto client = _client.lock();
+    const std::string where = _endpoint->absoluteString();
+    const LockToken abandoned = client ? client->tokens.abandonedFor(where) : LockToken();
+    if (isPlausible(abandoned) && take(ask(abandoned), abandoned)) return true;
+    const auto orphan = _ledger.orphan(where);
+    if (!orphan || !isPlausible(*orphan) || !take(ask(*orphan), *orphan)) return false;
+    CXDLog("Took over the lock on %@ of an earlier run", _name);
+    return true;
 }
 
 bool StoreLock::tryLock() {
@@ -166,15 +188,8 @@ bool StoreLock::tryLock() {
     if (locked()) return true;
     if (!_endpoint) return false;
     const std::string where = _endpoint->absoluteString();
-    HttpResponse answer = ask({});
-    if (answer.status == 423) { // perhaps by an earlier run of ours that did not come to release it
-        const auto orphan = _ledger.orphan(where);
-        if (!orphan || !isPlausible(*orphan)) return false;
-        if (!take(ask(*orphan), *orphan)) return false;
-        CXDLog("Took over the lock on %@ of an earlier run", _name);
-    } else if (!take(answer, {})) {
-        return false;
-    }
+    const HttpResponse answer = ask({});
+    if (!(answer.status == 423 ? takeOver() : take(answer, {}))) return false;
     LockToken token;
     {
         std::lock_guard guard(_mutex);
@@ -192,8 +207,9 @@ bool StoreLock::renew() {
         token = _token;
     }
     if (token.empty()) return false;
-    if (take(ask(token), token)) return true;
-    lose();
+    const HttpResponse answer = ask(token);
+    if (take(answer, token)) return true;
+    lose(settled(answer));
     return false;
 }
 
@@ -205,18 +221,13 @@ void StoreLock::unlock() {
         token = _token;
     }
     if (token.empty()) return;
+    bool storeAnswered = false;
     if (const auto client = _client.lock()) {
         HttpRequest r = StoreSession::request("UNLOCK", *_endpoint);
         r.headers = {{"Lock-Token", "<" + token.str() + ">"}};
-        const HttpResponse answer = client->session.send(std::move(r));
-        if (!answer.complete()) { // it expires by itself; the note lets a later run take it over
-            std::lock_guard guard(_mutex);
-            _token = LockToken();
-            client->tokens.drop(_endpoint->absoluteString(), token);
-            return;
-        }
+        storeAnswered = settled(client->session.send(std::move(r)));
     }
-    lose();
+    lose(storeAnswered);
 }
 
 bool StoreLock::locked() const {

@@ -42,7 +42,8 @@ public:
 private:
     HttpResponse ask(const LockToken& refreshed);
     bool take(const HttpResponse& answer, const LockToken& known);
-    void lose();
+    bool takeOver();
+    void lose(bool storeAnswered);
 
     const std::weak_ptr<CXDAVManager::Impl> _client;
     const Url _name;

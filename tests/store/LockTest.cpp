@@ -97,6 +97,36 @@ TEST_F(Locks, ALockOfARunThatWasKilledIsTakenOverAndOnesOfLivingRunsAreNot) {
     EXPECT_FALSE(mine->renew());
 }
 
+// Its end would be minutes away, and every pass until then would find its own lock in its way.
+TEST_F(Locks, ALockWhoseReleaseOrRenewalWasNotHeardOfIsTakenOverByTheSameClient) {
+    HttpResponse lost;
+    lost.error = TransportError::unreachable;
+    for (const auto& [renewed, answer] : {std::pair(false, lost), {true, lost}, {false, answerOf(503)}}) {
+        auto mine = lock(alice);
+        ASSERT_TRUE(mine->tryLock());
+        alice.wire->intercept([given = answer](const HttpRequest&) { return std::optional(given); });
+        renewed ? void(mine->renew()) : mine->unlock();
+        alice.wire->intercept(nullptr);
+        EXPECT_FALSE(mine->locked());
+        EXPECT_FALSE(lock(second)->tryLock()) << "another client's object of the same process";
+        auto next = lock(alice);
+        EXPECT_TRUE(next->tryLock()) << alice.wire->text();
+        EXPECT_EQ(alice.write("dateFile", "why"), 204);
+        next->unlock();
+        auto free = lock(second);
+        EXPECT_TRUE(free->tryLock());
+        free->unlock();
+    }
+}
+
+TEST_F(Locks, ALockThatIsHeldIsNotTakenOverByAnotherObjectOfTheSameClient) {
+    auto mine = lock(alice);
+    ASSERT_TRUE(mine->tryLock());
+    EXPECT_FALSE(lock(alice)->tryLock());
+    EXPECT_TRUE(mine->renew());
+    mine->unlock();
+}
+
 TEST_F(Locks, AnUnheldLockNeverLooksSoonToExpire) {
     auto mine = lock(alice);
     EXPECT_GT(mine->expires().secondsSince(Clock::system().now()), CXWebDAVLock::lockTimeout() - 5);
