@@ -176,15 +176,26 @@ StoreFiles::Fetched StoreFiles::fetchEither(const Url& url, Url& target) {
     return second;
 }
 
+// A group's state that is no dictionary may be replaced, its members with it. So that must not be the answer of a
+// connection that was cut off: only what is read the same way twice counts.
+StoreFiles::Fetched StoreFiles::confirmed(const Fetched& once, const Url& target) {
+    Fetched again = fetch(target, false);
+    const bool same = again.version.etag == once.version.etag && again.version.size == once.version.size;
+    if (again.found == Found::noDictionary && !same) again.found = Found::failed;
+    return again;
+}
+
 // Keeps what a following write of this thread has to find.
 void StoreFiles::note(const Url& name, const Url& target, const Fetched& fetched) {
     ReadMark mark{name, target, true, ReadMark::State::unknown, fetched.version.etag};
     if (fetched.found == Found::absent) {
         mark.state = ReadMark::State::absent;
         _versions.forget(name.absoluteString());
-    } else if (fetched.found == Found::dictionary || fetched.found == Found::noDictionary) {
+    } else if (fetched.found == Found::dictionary) {
         mark.state = ReadMark::State::present;
         _versions.read(name.absoluteString(), fetched.version);
+    } else if (fetched.found == Found::noDictionary) {
+        mark.state = ReadMark::State::present; // and its version stays unseen: nobody has learnt what it says
     }
     lastReads[_reader] = std::move(mark);
 }
@@ -195,6 +206,7 @@ StoreFiles::Reading StoreFiles::read(const Url& name, bool securely) {
     if (!url) return {};
     Url target = *url;
     Fetched fetched = mayBeBoth(name) ? fetchEither(*url, target) : fetch(*url, false);
+    if (mayBeBoth(name) && fetched.found == Found::noDictionary) fetched = confirmed(fetched, target);
     note(name, target, fetched);
     return {fetched.code, std::move(fetched.dictionary)};
 }

@@ -47,6 +47,7 @@ private:
     };
     Fetched fetch(const Url& url, bool mayBeCollection);
     Fetched fetchEither(const Url& url, Url& target);
+    Fetched confirmed(const Fetched& once, const Url& target);
     void note(const Url& name, const Url& target, const Fetched& fetched);
 
     int put(const Url& name, const Url& target, const std::shared_ptr<const std::string>& body,

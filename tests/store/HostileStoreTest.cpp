@@ -169,6 +169,48 @@ TEST(HostileStore, WhatIsNoPropertyListIsNoDictionary) {
     }
 }
 
+// An answer whose end nobody announced, from a connection that was cut off.
+TEST(HostileStore, AStateThatWasCutOffIsNotReplaced) {
+    const std::string whole = PropertyList::toXML(Dictionary{{"memberUIDState", Array{"A:CXPerson", "B:CXPerson"}}});
+    std::vector<std::string> bodies;
+    Scripted s([&](const HttpRequest& r) {
+        if (r.method == "OPTIONS") return kDavOptions;
+        if (r.method == "PUT") return answerOf(204);
+        const std::string body = bodies.front();
+        if (bodies.size() > 1) bodies.erase(bodies.begin());
+        return answerOf(200, {{"etag", "\"1\""}}, body);
+    });
+    const Url group = s.base.cxURLByAppendingComponent("A:CXGroup");
+
+    bodies = {whole.substr(0, 150), whole};
+    EXPECT_TRUE(s.manager->dictionaryAtURL(group, false, nullptr)) << "asked again";
+
+    bodies = {whole.substr(0, 150), whole.substr(0, 170)};
+    EXPECT_FALSE(s.manager->dictionaryAtURL(group, false, nullptr));
+    int code = -1;
+    EXPECT_FALSE(s.manager->write("x", group, false, &code));
+    EXPECT_EQ(code, 0);
+    EXPECT_EQ(s.wire->count("PUT"), 0u);
+
+    bodies = {"garbage"};
+    EXPECT_FALSE(s.manager->dictionaryAtURL(group, false, nullptr));
+    EXPECT_TRUE(s.manager->write("x", group, false)) << "what the store really holds can be replaced";
+}
+
+TEST(HostileStore, AVersionThatCouldNotBeUnderstoodStaysUnseen) {
+    Scripted s([&](const HttpRequest& r) {
+        if (r.method == "OPTIONS") return kDavOptions;
+        if (r.method == "GET") return answerOf(200, {{"etag", "\"1\""}}, "<?xml version=\"1.0\"?><plist><dict>");
+        return answerOf(207, {{"date", "Sat, 21 Nov 2026 10:00:00 GMT"}},
+                        multistatus(response("/dav/alice/Contacts/", true) +
+                                    response("/dav/alice/Contacts/x", false, "<D:getetag>\"1\"</D:getetag>")));
+    });
+    s.manager->dictionaryAtURL(s.base.cxURLByAppendingComponent("x"), false, nullptr);
+    const auto listing = s.manager->infoForFilesInContainer(s.base);
+    ASSERT_TRUE(listing);
+    EXPECT_EQ(listing->begin()->second.modificationdate->toHTTP(), "Sat, 21 Nov 2026 10:00:00 GMT");
+}
+
 TEST(HostileStore, NamesOfAnotherStoreAreNeverAskedFor) {
     Scripted s([](const HttpRequest&) { return answerOf(200); });
     int code = -1;
