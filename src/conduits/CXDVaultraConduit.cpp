@@ -180,6 +180,9 @@ bool CXDVaultraConduit::applyChangeRecord(const CXDChangeRecordPtr& record, bool
 }
 
 bool CXDVaultraConduit::apply(CXDChangeRecord& record, int& code) {
+    // Identifiers also come out of other people's lists: one that names the tree's own files would destroy those.
+    for (const auto& name : {record.person(), record.group()})
+        if (name && !layout::isARecordsName(*name)) return false;
     switch (record.type()) {
     case CXDUpdateRecord: return updateRecord(record, code);
     case CXDCreateStructureForGroup: return createStructureForGroup(record, code);

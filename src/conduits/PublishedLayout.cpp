@@ -46,6 +46,10 @@ bool isASpecialFile(std::string_view name) {
     return name == kDateFile || name == kInfo || name == kContacts;
 }
 
+bool isARecordsName(const UniqueId& uid) {
+    return !uid.empty() && !isASpecialFile(uid.str()) && uid.str() != kPeople && uid.str().front() != '.';
+}
+
 Dictionary groupStateAfterComposite(const Dictionary& state, const Dictionary& payload) {
     Dictionary after = Value(state).deepMutableCopy().dictionary();
     updateList(after, kMemberUIDState, payload[kMemberAdds].array(), payload[kMemberRemoves].array());

@@ -36,6 +36,9 @@ Url dateFileLocation(const Url& base);
 // Bookkeeping files, never contacts or groups: exactly "dateFile", "info" or "Contacts".
 bool isASpecialFile(std::string_view name);
 
+// Whether a group or person may be called so in a tree: no name of the tree's own files and folders.
+bool isARecordsName(const UniqueId& uid);
+
 // The group state after a composite change; `state` and `payload` stay as they are. Additions come before removals, a
 // member is listed once however often it is added, a removal takes out every occurrence, and the three containers
 // exist afterwards. A part of either that is of another kind than expected counts as empty.

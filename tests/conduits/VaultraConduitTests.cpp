@@ -435,6 +435,62 @@ TEST_F(VaultraConduit, RecordsWithoutWhatTheyNameFailAndSendNothing) {
     EXPECT_EQ(client->wire->methods(), "");
 }
 
+TEST_F(VaultraConduit, ARecordThatIsCalledLikeTheTreesOwnFilesTouchesNothing) {
+    open();
+    for (const char* name : {"People", "info", "dateFile", "Contacts", ".state", "..", ""}) {
+        for (const int type : {CXDCreateStructureForGroup, CXDCompositeGroupChange, CXDChangeGroupName, CXDDeleteGroup})
+            EXPECT_FALSE(conduit->applyChangeRecordIfNeeded(record(type, nullptr, name, Dictionary()))) << name;
+        EXPECT_FALSE(conduit->applyChangeRecordIfNeeded(record(CXDAddRecordToGroup, name, "G:CXGroup"))) << name;
+        EXPECT_FALSE(conduit->applyChangeRecordIfNeeded(record(CXDDeleteRecord, name, nullptr))) << name;
+    }
+    EXPECT_EQ(client->wire->methods(), "");
+    EXPECT_TRUE(std::filesystem::is_directory(world->file("People/31")));
+}
+
+// Which of an account's two endpoints a write goes to: contacts and what names them never leave unencrypted.
+TEST_F(VaultraConduit, ContactsAndStatesAreWrittenSecurelyMarkersNamesAndTheClockAreNot) {
+    CXDAVAccount account;
+    account.user = UserName("alice");
+    account.endpoint = "http://localhost:1/dav/{user}/Contacts";
+    account.secureEndpoint = "https://localhost:2/dav/{user}/Contacts";
+    account.nameHost = "contacts.example.org";
+    account.plainLoopback = true;
+    const auto wire = std::make_shared<RecordingTransport>();
+    Texts asked;
+    wire->intercept([&](const HttpRequest& request) {
+        if (request.method == "PUT" || request.method == "GET")
+            asked.push_back(request.url.scheme() + " " + request.method + " " + request.url.cxLastComponent());
+        if (request.method == "OPTIONS") return answerOf(200, {{"dav", "1, 2"}});
+        if (request.method == "HEAD") return answerOf(200, {{"last-modified", "Sat, 21 Nov 2026 10:00:00 GMT"}});
+        return answerOf(request.method == "GET" ? 404 : 201);
+    });
+    CXDAVManager manager(account, wire);
+    CXDVaultraConduit plain(engine,
+                            CXDVaultraConduit::World{manager, network, preferences, clock, center, distributed, alert});
+    const auto requestsOf = [&](const CXDChangeRecordPtr& change) {
+        asked.clear();
+        EXPECT_TRUE(plain.applyChangeRecord(change));
+        return asked;
+    };
+    EXPECT_EQ(requestsOf(record(CXDUpdateRecord, "P", nullptr, Dictionary())), Texts{"https PUT P"});
+    EXPECT_EQ(requestsOf(record(CXDCreateStructureForGroup, nullptr, "G", Dictionary())), Texts{"https PUT info"});
+    EXPECT_EQ(requestsOf(record(CXDCompositeGroupChange, nullptr, "G", Dictionary())),
+              (Texts{"http GET G", "https PUT G"}));
+    EXPECT_EQ(requestsOf(record(CXDChangeGroupName, nullptr, "G", "New")), Texts{"http PUT info"});
+    EXPECT_EQ(requestsOf(record(CXDAddRecordToGroup, "P", "G")), Texts{"http PUT P"});
+    asked.clear();
+    EXPECT_TRUE(plain.currentServerDate());
+    EXPECT_EQ(asked, Texts{"http PUT dateFile"});
+}
+
+TEST_F(VaultraConduit, TheServersDateIsAskedForWhateverBecameOfTheWrite) {
+    open();
+    const auto before = client->manager.modDateForURL(client->at("dateFile"));
+    ASSERT_TRUE(before);
+    answerEvery("PUT", 507);
+    EXPECT_EQ(conduit->currentServerDate(), before);
+}
+
 TEST_F(VaultraConduit, ChangesThatTheStoreHasNoPlaceForFail) {
     open();
     for (int type : std::initializer_list<int>{0, CXDAddGroupToGroup, CXDUpdateDistributionList,
