@@ -22,6 +22,16 @@ bool isStoreScheme(std::string_view scheme) {
                                             [](unsigned char a, char b) { return std::tolower(a) == b; });
 }
 
+// What goes wrong on the renewal thread is a renewal that failed, and no more.
+bool renews(CXWebDAVLock& lock) {
+    try {
+        return lock.renew();
+    } catch (const CXException& e) {
+        CXLog("A lock could not be renewed: %@", e);
+        return false;
+    }
+}
+
 class SteadySleep : public InterruptibleSleep {
 public:
     bool sleep(double seconds) override {
@@ -113,7 +123,11 @@ void RemoteLocks::unlockAllURLs() {
         const Held last = std::move(_heldLocks.back());
         _heldLocks.pop_back();
         unlockList();
-        last.lock->unlock();
+        try {
+            last.lock->unlock();
+        } catch (const CXException& e) {
+            CXLog("The lock on %s is left to expire: %@", last.key, e);
+        }
     }
     _sleep->interrupt();
 }
@@ -171,7 +185,7 @@ void RemoteLocks::renewOnce(std::shared_ptr<CXWebDAVLock>& renewedLast) {
     renewedLast.reset();
     if (!_sleep->sleep(pause) || _ending) return; // the list changed, or the end: choose again
     if (!chosen->locked()) return;
-    if (chosen->renew()) {
+    if (renews(*chosen)) {
         renewedLast = chosen;
         return;
     }

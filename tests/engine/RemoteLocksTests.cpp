@@ -1,6 +1,7 @@
 #include "engine/RemoteLocks.h"
 
 #include "Records.h"
+#include "foundation/CXException.h"
 
 #include <algorithm>
 #include <gtest/gtest.h>
@@ -14,6 +15,7 @@ class FakeStore {
 public:
     explicit FakeStore(const Clock& clock) : _clock(clock) {}
     bool grants = true, renews = true;
+    std::string breaksAt; // "renew" or "unlock": that request ends in an exception
     double timeout = 300;
     std::function<void()> beforeTry; // on the thread that takes the lock
 
@@ -57,6 +59,7 @@ private:
             _expires = _store._clock.now().addingSeconds(_store.timeout);
             _store._asked.push_back(std::string(what) + " " + _url.absoluteString());
             _store._changed.notify_all();
+            if (_store.breaksAt == what) throw CXException("TestException", "no answer");
             return held;
         }
         FakeStore& _store;
@@ -237,6 +240,30 @@ TEST_F(Locks, ALockThatCannotBeRenewedIsDroppedWithoutBeingReleased) {
     EXPECT_EQ(locks.condition(), 0);
     locks.unlockAllURLs();
     EXPECT_EQ(store.asked().size(), 2u);
+}
+
+TEST_F(Locks, AnExceptionOutOfARenewalIsAFailedRenewal) {
+    const test::LogCapture log(0);
+    store.breaksAt = "renew";
+    locks.startRenewing();
+    lock("/G1");
+    sleep->waitForSleepOf(270);
+    sleep->letTimePass();
+    store.waitFor("renew " + clockFile, 1);
+    locks.stopRenewing();
+    EXPECT_EQ(locks.count(), 0u);
+    EXPECT_TRUE(log.has("no answer"));
+}
+
+TEST_F(Locks, ALockThatCannotBeReleasedKeepsNoOther) {
+    const test::LogCapture log(0);
+    store.breaksAt = "unlock";
+    lock("/G1");
+    locks.lockURL(Url("http://store.example/bob/Contacts/G1"));
+    locks.unlockAllURLs();
+    EXPECT_EQ(store.asked().size(), 4u) << "both were asked to be released";
+    EXPECT_EQ(locks.count(), 0u);
+    EXPECT_TRUE(log.has("The lock on " + clockFile + " is left to expire: "));
 }
 
 TEST_F(Locks, AfterAllAreReleasedNothingIsRenewedUntilTheNextLock) {
