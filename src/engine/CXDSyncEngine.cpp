@@ -206,6 +206,9 @@ void CXDSyncEngine::applyChangeRecords(const CXDChangeRecords& records, bool tri
 }
 
 void CXDSyncEngine::applyChangeRecords(CXDChangeRecords records, bool trickle, bool allowRetry) {
+    // Whoever delivers them must not take them for done.
+    if (_parts->ending)
+        throw CXException(kCXInvalidArgumentException, "the process is ending, and its changes wait for the next one");
     runPass([this, trickle, allowRetry, records = std::move(records)]() mutable {
         apply(std::move(records), trickle, allowRetry);
     });

@@ -236,6 +236,38 @@ TEST(EngineEnd, StopsProgressAndLeavesALine) {
     EXPECT_TRUE(log.has("Killing RolvaneManager"));
 }
 
+TEST(EngineEnd, ProgressStopsThenTheLoopTurnsOnceThenTheLineIsLogged) {
+    World world;
+    world.start();
+    test::CapturingLog log;
+    test::DebugLevel level(1);
+    std::vector<std::string> seen;
+    world.loop.performAfterDelay(0, [&] {
+        seen = world.events.all();
+        seen.push_back(log.has("Killing RolvaneManager") ? "too late" : "turn");
+        world.loop.performAfterDelay(0, [&] { seen.push_back("another turn"); });
+    });
+    EXPECT_TRUE(ends([&] { world.engine->killCXD(); }));
+    EXPECT_EQ(seen, (std::vector<std::string>{"stop", "turn"}));
+}
+
+TEST(EngineEnd, WhatIsDeliveredMeanwhileWaitsInTheDatabaseForTheNextProcess) {
+    World world;
+    world.start();
+    world.rolvane->cursorPosition(); // watching from here on
+    const auto observation =
+        world.center.observe(kCXDatabaseChangedExternallyNotificationPriv,
+                             [&](const Notification&) { world.engine->applyChangeRecords({update("P1")}); });
+    const auto application = world.application();
+    application->addRecord(CXPerson::create());
+    application->save();
+    world.loop.performAfterDelay(0, [&] { world.rolvane->deliverExternalChanges(); });
+    const test::CapturingLog log;
+    EXPECT_TRUE(ends([&] { world.engine->killCXD(); }));
+    EXPECT_TRUE(world.vaultra->applied().empty());
+    EXPECT_TRUE(world.rolvane->hasExternalChanges());
+}
+
 TEST(EngineEnd, AFailedPasswordEndsTheProcess) {
     World world;
     world.start();
