@@ -187,6 +187,8 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
     std::erase_if(_pendingChanges, [&](const CXDChangeRecordPtr& record) { return _parts.denied.contains(*record); });
     CXDLog("Pending: %@", _pendingChanges);
     CXDLog("Denied:  %@", _parts.denied.all());
+    // A change leaves the queue only when the database that took it has it on the disk.
+    _parts.with.rolvane.save();
     _parts.state.setPendingChanges(_pendingChanges);
     _queueStored = true;
     _pendingChanges.clear();
@@ -198,10 +200,18 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
     _parts.conduits.vaultra->close();
 }
 
-// Account and conduit data are put down first, so that they reach the disk in one piece with the share count.
+// Account and conduit data are put down first, so that they reach the disk in one piece with the share count. They
+// never run ahead of the database: what they say it holds and it does not would be taken for the user's own removal.
 void ApplyLoop::bumpShareCount() {
     const std::optional<UserName> user = _parts.with.account.vaultraUser();
     Preferences& preferences = _parts.with.preferences;
+    try {
+        _parts.with.rolvane.save();
+    } catch (const CXException& e) {
+        CXLog("applyChangeRecords: Caught %@: %@", e.name(), e.reason());
+        _parts.state.dropConduitData();
+        return;
+    }
     try {
         preferences.set(kDaemonDomain, kCXDLastOstrelUser, user ? Value(*user) : Value());
         _parts.state.putConduitData();

@@ -15,9 +15,10 @@ class OutOfOrderWork;
 // One apply pass, from the records that were gathered to the queue that is left. Built for one pass on the main thread.
 //
 // Nothing is lost on the way: what an exception leaves unhandled stays pending, and the stored queue is replaced only
-// after it has been read. The durable steps of the end come in this order: queue, last-sync dates (the conduits'
-// `close`), then account, conduit data and share count together. A crash between any two of them makes the next pass
-// find some changes again, and applying them again changes nothing.
+// after it has been read. The durable steps of the end come in this order: contact database, queue, last-sync dates
+// (the conduits' `close`), then account, conduit data and share count together. A crash between any two of them makes
+// the next pass find some changes again, and applying them again changes nothing. While the contact database cannot be
+// saved none of the later ones is written.
 class ApplyLoop {
 public:
     struct Actions {

@@ -280,6 +280,31 @@ TEST_F(Pass, AFullDiskLeavesTheChangesWithWhoeverDeliveredThem) {
     EXPECT_EQ(world.pending(), Strings{"P1:2"});
 }
 
+TEST_F(Pass, WhatTheContactDatabaseCouldNotSaveIsNotWrittenDownAsApplied) {
+    trickle({});
+    const auto known = [&] {
+        const Value state = world.stored("CXDConduitData").dictionary()["CXDCX"].dictionary()["priorState"];
+        return state.dictionary()["<self>"].dictionary().contains("G1:CXGroup");
+    };
+    world.cx->whenApplying = [&](const CXDChangeRecordPtr&, bool*) {
+        world.rolvane->addRecord(CXPerson::create());
+        test::interceptWrites([] { return false; });
+        return true;
+    };
+    const auto membership = makeRecord(CXDAddRecordToGroup, "P1:CXPerson", "G1:CXGroup", {4, 1, "<self>"});
+    test::CapturingLog log;
+    EXPECT_THROW(trickle({membership}), CXException);
+    test::interceptWrites(nullptr);
+    EXPECT_TRUE(world.rolvane->hasUnsavedChanges());
+    EXPECT_FALSE(known()) << "the next comparison would take the missing member for one that the user removed";
+    EXPECT_FALSE(world.engine->conduitObjectForKey("CXDCX", "priorState").contains("<self>"));
+
+    world.cx->whenApplying = nullptr;
+    trickle({membership});
+    EXPECT_FALSE(world.rolvane->hasUnsavedChanges());
+    EXPECT_TRUE(known());
+}
+
 // -- denials
 
 TEST_F(Pass, ADeniedChangeIsDroppedCancelsItsUsersOthersAndIsRetriedOnce) {

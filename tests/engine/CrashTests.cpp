@@ -211,6 +211,41 @@ TEST_F(Crash, BeforeAnyWriteOfAPassLosesNothingAndDoublesNothing) {
     EXPECT_GT(write, 10) << "the pass has far more writes than were killed";
 }
 
+// As the contact conduit does: a record goes into the database, which is saved when the source is closed.
+void takeIntoTheDatabase(Daemon& daemon) {
+    World& world = daemon.world;
+    world.cx->whenApplying = [&world](const CXDChangeRecordPtr& record, bool*) {
+        world.rolvane->addRecord(CXPerson::initWithUniqueId(*record->person()));
+        return true;
+    };
+    world.cx->whenClosing = [&world] { world.rolvane->save(); };
+}
+
+TEST_F(Crash, BeforeAnyWriteNoChangeHasLeftTheQueueThatTheContactDatabaseDoesNotHave) {
+    const UniqueId person("P7:CXPerson");
+    Daemon(before / "daemon")
+        .world.engine->setPendingChanges(
+            {makeRecord(CXDUpdateRecord, person.str().c_str(), nullptr, {4, 1, "<self>"})});
+    int write = 0;
+    for (bool ended = false; !ended; ++write) {
+        const std::string root = freshCopy(write);
+        ended = killedBefore(write, root, [](Daemon& daemon) {
+            takeIntoTheDatabase(daemon);
+            daemon.pass();
+        });
+
+        SCOPED_TRACE("killed before write " + std::to_string(write));
+        Daemon daemon(root);
+        const bool queued = !daemon.world.pending().empty();
+        const bool saved = daemon.world.rolvane->recordForUniqueId(person) != nullptr;
+        EXPECT_TRUE(queued || saved);
+        EXPECT_TRUE(!ended || (saved && !queued));
+        if (HasFailure()) break;
+        fs::remove_all(root);
+    }
+    EXPECT_GT(write, 10);
+}
+
 TEST_F(Crash, BeforeAnyWriteOfADeliveryLosesNoOtherProcesssEdit) {
     {
         Daemon watching(before / "daemon");
