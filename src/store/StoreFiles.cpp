@@ -284,13 +284,14 @@ int StoreFiles::remove(const Url& name) {
 
 // ---- collections
 
-StoreFiles::Kind StoreFiles::kindOf(const Url& url) {
+StoreFiles::Kind StoreFiles::kindOf(const Url& url, EntityTag* tag) {
     const HttpResponse answer = _session.send(StoreSession::propfind(url, 0));
     if (answer.status == 404) return Kind::absent;
     MultistatusReader reader;
     if (answer.status != 207 || !reader.feed(answer.body)) return Kind::unknown;
     const auto entries = reader.finish();
     if (!entries || entries->size() != 1) return Kind::unknown;
+    if (tag) *tag = entries->front().etag;
     return entries->front().isCollection ? Kind::collection : Kind::file;
 }
 
@@ -304,16 +305,17 @@ bool StoreFiles::makeCollection(const Url& name) {
         return true;
     }
     if (answer.status != 405 && answer.status != 409 && (answer.status < 300 || answer.status >= 400)) return false;
-    const Kind kind = kindOf(*url);
-    if (kind == Kind::file && !moveIntoCollection(*url)) return false;
+    EntityTag tag;
+    const Kind kind = kindOf(*url, &tag);
+    if (kind == Kind::file && !moveIntoCollection(*url, tag)) return false;
     if (kind != Kind::collection && kind != Kind::file) return false;
     remember(*url);
     return true;
 }
 
 // The new collection is made beside the file, gets a copy of it as its state, and then takes its place in one request:
-// at no moment is the state missing.
-bool StoreFiles::moveIntoCollection(const Url& url) {
+// at no moment is the state missing. It does so only if the file is still the one that was copied.
+bool StoreFiles::moveIntoCollection(const Url& url, const EntityTag& tag) {
     const Url making = url.cxURLByDeletingLastComponent().cxURLByAppendingComponent(url.cxLastComponent() +
                                                                                     std::string(kMakingSuffix));
     const HttpResponse made = _session.send(StoreSession::request("MKCOL", making));
@@ -323,6 +325,7 @@ bool StoreFiles::moveIntoCollection(const Url& url) {
     if (!_session.send(std::move(copy)).ok()) return false;
     HttpRequest move = StoreSession::request("MOVE", making);
     move.headers = {{"Destination", url.absoluteString()}, {"Overwrite", "T"}};
+    if (!tag.empty()) move.headers.emplace_back("If", taggedCondition(url, "[" + tag.str() + "]"));
     return _session.send(std::move(move)).ok();
 }
 

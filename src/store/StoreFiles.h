@@ -53,8 +53,8 @@ private:
     int put(const Url& name, const Url& target, const std::shared_ptr<const std::string>& body,
             std::vector<std::pair<std::string, std::string>> headers);
     enum class Kind { absent, file, collection, unknown };
-    Kind kindOf(const Url& url);
-    bool moveIntoCollection(const Url& url);
+    Kind kindOf(const Url& url, EntityTag* tag = nullptr);
+    bool moveIntoCollection(const Url& url, const EntityTag& tag); // `tag`: the file's; empty when the store gives none
 
     bool knownCollection(const Url& url) const;
     void remember(const Url& url);

@@ -99,6 +99,23 @@ TEST_F(Publishing, AGroupsStateSurvivesTheMakingOfItsFolder) {
     EXPECT_EQ(fresh.read(std::string(kGroup) + "/info").second, (Dictionary{{"name", "Friends"}}));
 }
 
+TEST_F(Publishing, AStateThatIsWrittenWhileItsFolderIsMadeIsNotLost) {
+    ASSERT_TRUE(alice.manager.sanityCheckPublishStructureCreate(true));
+    ASSERT_EQ(alice.write(kGroup, kState), 201);
+    Client other(world);
+    alice.wire->intercept([&](const HttpRequest& request) -> std::optional<HttpResponse> {
+        if (request.method == "MOVE") {
+            EXPECT_EQ(other.write(kGroup, kOther), 204);
+        }
+        return std::nullopt;
+    });
+    EXPECT_FALSE(alice.manager.createDirectoryAtAURL(alice.at(kGroup)));
+    EXPECT_EQ(other.read(kGroup).second, kOther) << alice.wire->text();
+    alice.wire->intercept(nullptr);
+    EXPECT_TRUE(alice.manager.createDirectoryAtAURL(alice.at(kGroup))) << alice.wire->text();
+    EXPECT_EQ(other.read(kGroup).second, kOther);
+}
+
 TEST_F(Publishing, AGroupsStateIsWrittenIntoItsFolderWhenThatCameFirst) {
     ASSERT_TRUE(alice.manager.sanityCheckPublishStructureCreate(true));
     ASSERT_TRUE(alice.manager.createDirectoryAtAURL(alice.at(kGroup)));
