@@ -5,6 +5,7 @@
 #include "foundation/Paths.h"
 #include "store/CXDAVManager.h"
 
+#include <filesystem>
 #include <fmt/format.h>
 
 namespace rolvane::cli {
@@ -14,13 +15,18 @@ namespace {
 using Json = nlohmann::ordered_json;
 
 struct AccountOptions {
-    std::string user, endpoint, host, caFile, authentication = "automatic";
+    std::string user, endpoint, secureEndpoint, host, caFile, authentication = "automatic";
     std::string passwordCommand, passwordCredential, passwordFile;
     bool askPassword = false, noPassword = false, plainLoopback = false, store = false;
 };
 
 std::string passwordPath() {
     return configDirectory() + "/password";
+}
+
+// The daemon reads the files from another directory than this one. Empty stays empty.
+std::string absolutePath(const std::string& path) {
+    return path.empty() ? path : std::filesystem::absolute(path).lexically_normal().string();
 }
 
 Authentication authenticationNamed(const std::string& name) {
@@ -34,7 +40,7 @@ PasswordSource passwordSource(const AccountOptions& options, const PasswordSourc
     if (options.noPassword) return {Kind::none, {}};
     if (!options.passwordCommand.empty()) return {Kind::command, options.passwordCommand};
     if (!options.passwordCredential.empty()) return {Kind::credential, options.passwordCredential};
-    if (!options.passwordFile.empty()) return {Kind::file, options.passwordFile};
+    if (!options.passwordFile.empty()) return {Kind::file, absolutePath(options.passwordFile)};
     if (!options.askPassword) return former;
     const std::string password = readSecret("Password of " + user + ": ");
     if (password.empty()) throw CommandError(kUsage, "The password is empty. Nothing was changed.");
@@ -42,24 +48,41 @@ PasswordSource passwordSource(const AccountOptions& options, const PasswordSourc
     return {Kind::file, passwordPath()};
 }
 
+// Refuses a source that gives no password, in the source's own words.
+void requirePassword(const CXDAVAccount& account) {
+    try {
+        (void)account.password();
+    } catch (const CXException& error) {
+        throw CommandError(kRefused, error.reason());
+    }
+}
+
 std::optional<CXDAVAccount> savedAccount() {
     return CXDAVAccount::load();
 }
 
 void setAccount(Context& context, CLI::App& command, const AccountOptions& options) {
-    CXDAVAccount account;
-    if (const auto saved = savedAccount()) account = *saved;
-    const std::string formerUser = account.user.str();
     const auto given = [&](const char* option) { return command.get_option(option)->count() > 0; };
+    CXDAVAccount account;
+    try {
+        if (const auto saved = savedAccount()) account = *saved;
+    } catch (const CXException& error) { // one that cannot be used is replaced by a whole new one only
+        if (!given("--user") || !given("--endpoint"))
+            throw CommandError(kFailed, error.reason() + " Make the account anew: give --user and --endpoint.");
+    }
+    const std::string formerUser = account.user.str();
     if (given("--user")) account.user = UserName(options.user);
     if (given("--endpoint")) account.endpoint = options.endpoint;
+    if (given("--secure-endpoint")) account.secureEndpoint = options.secureEndpoint;
     if (given("--host")) account.nameHost = options.host;
-    if (given("--ca-file")) account.caFile = options.caFile;
+    if (given("--ca-file")) account.caFile = absolutePath(options.caFile);
     if (given("--authentication")) account.authentication = authenticationNamed(options.authentication);
     if (given("--plain-loopback")) account.plainLoopback = options.plainLoopback;
     if (account.user.empty()) throw CommandError(kUsage, "Name the user with --user.");
+    if (const auto problem = account.problem()) throw CommandError(kUsage, *problem);
     account.passwordSource = passwordSource(options, account.passwordSource, account.user.str());
     if (const auto problem = account.problem()) throw CommandError(kUsage, *problem);
+    if (given("--password-file")) requirePassword(account); // a file that cannot be used is better told now
     account.save();
     context.say(fmt::format("The account of {} at {} is saved. `rolvane account test` tries it.", account.user.str(),
                             account.endpoint));
@@ -91,6 +114,7 @@ void showAccount(Context& context) {
     const Json data{
         {"user", account->user.str()},
         {"endpoint", account->endpoint},
+        {"secureEndpoint", account->secureEndpoint},
         {"host", account->effectiveNameHost()},
         {"location", account->baseLocationFor(account->user).absoluteString()},
         {"authentication", authentication},
@@ -110,8 +134,9 @@ void showAccount(Context& context) {
 
 // Signs in and looks whether the tree is there. Exit code 5 for a refused login, 6 for a store that is not reached.
 void testAccount(Context& context) {
-    if (!savedAccount())
-        throw CommandError(kNotFound, "There is no account on a store yet. `rolvane account set` makes one.");
+    const auto account = savedAccount();
+    if (!account) throw CommandError(kNotFound, "There is no account on a store yet. `rolvane account set` makes one.");
+    requirePassword(*account);
     CXDAVError error;
     const bool reachable = CXDAVManager::canReachOstrelError(error);
     const bool structure = reachable && CXDAVManager::defaultManager().sanityCheckPublishStructureCreate(false);
@@ -143,6 +168,8 @@ void addAccountCommands(CLI::App& app, Context& context) {
             c.add_option("--user", o->user, "User name on the store");
             c.add_option("--endpoint", o->endpoint,
                          "Where a user's tree is, such as https://dav.example.org/dav/{user}/Contacts");
+            c.add_option("--secure-endpoint", o->secureEndpoint,
+                         "The https endpoint of the same store, when --endpoint is plain http");
             c.add_option("--host", o->host, "Host in the names of locations; the endpoint's, unless given");
             c.add_option("--ca-file", o->caFile, "PEM file of a private certificate authority");
             c.add_option("--authentication", o->authentication, "automatic, basic or digest")

@@ -7,7 +7,9 @@
 #include "contacts/VCardImport.h"
 
 #include <cerrno>
+#include <cstdio>
 #include <cstring>
+#include <filesystem>
 #include <fmt/format.h>
 #include <fstream>
 #include <iostream>
@@ -51,6 +53,7 @@ Json importReport(const VCardImportReport& report) {
 
 void importCards(Context& context, const ImportOptions& options) {
     VCardImportReport report;
+    size_t unreadable = 0; // files
     {
         ProgressBar bar(context, "Importing");
         VCardImport import(context.database(), [&](const VCardProgress& progress) {
@@ -58,11 +61,16 @@ void importCards(Context& context, const ImportOptions& options) {
                 bar.update(static_cast<double>(progress.bytesDone) / static_cast<double>(progress.bytesTotal),
                            fmt::format("{} contacts", progress.cards));
         });
-        for (const std::string& file : options.files)
-            if (file == "-")
-                import.addStream(std::cin, "standard input");
-            else
-                import.addFile(file);
+        for (const std::string& file : options.files) try {
+                if (file == "-")
+                    import.addStream(std::cin, "standard input");
+                else
+                    import.addFile(file);
+            } catch (const CXException& error) {
+                if (error.name() != kCXVCardException) throw; // the others would fare no better
+                context.warn("rolvane: " + error.reason());
+                ++unreadable;
+            }
         report = import.finish();
     }
     for (const VCardError& error : report.errors)
@@ -74,7 +82,7 @@ void importCards(Context& context, const ImportOptions& options) {
     else
         context.say(fmt::format("{} imported, {} updated, {} unchanged, {} groups, {} bad cards left out.",
                                 report.imported, report.updated, report.unchanged, report.groups, report.errorCount));
-    if (report.errorCount > 0)
+    if (report.errorCount + unreadable > 0)
         context.exitCode = report.imported + report.updated + report.unchanged + report.groups > 0 ? kPartly : kFailed;
 }
 
@@ -83,6 +91,42 @@ void importCards(Context& context, const ImportOptions& options) {
 struct ExportOptions {
     std::string group, output, version = "4";
     std::vector<std::string> names;
+};
+
+// A file that takes the place of a former one of that name only when it is whole.
+class OutputFile {
+public:
+    explicit OutputFile(std::string path) : _path(std::move(path)) {
+        std::error_code none;
+        const auto status = std::filesystem::status(_path, none);
+        // A pipe or a device is written to as it is.
+        const bool replaced = !std::filesystem::exists(status) || std::filesystem::is_regular_file(status);
+        _written = replaced ? _path + ".part" : _path;
+        _stream.open(_written, std::ios::binary | std::ios::trunc);
+        if (!_stream) {
+            const std::string reason = std::strerror(errno);
+            _written = _path;
+            throw CommandError(kFailed, fmt::format("{} cannot be written ({}).", _path, reason));
+        }
+    }
+    ~OutputFile() {
+        if (_written != _path) std::remove(_written.c_str());
+    }
+    OutputFile(const OutputFile&) = delete;
+    OutputFile& operator=(const OutputFile&) = delete;
+    std::ostream& stream() { return _stream; }
+    void finish() {
+        _stream.close();
+        if (!_stream || (_written != _path && std::rename(_written.c_str(), _path.c_str()) != 0))
+            throw CommandError(kFailed, fmt::format("{} could not be written whole ({}). What was there before is as "
+                                                    "it was.",
+                                                    _path, std::strerror(errno)));
+        _written = _path;
+    }
+
+private:
+    std::string _path, _written;
+    std::ofstream _stream;
 };
 
 size_t exportTo(Context& context, const ExportOptions& options, std::ostream& out) {
@@ -104,15 +148,9 @@ void exportCards(Context& context, const ExportOptions& options) {
     if (options.output.empty() || options.output == "-") {
         cards = exportTo(context, options, std::cout);
     } else {
-        std::ofstream file(options.output, std::ios::binary | std::ios::trunc);
-        if (!file)
-            throw CommandError(kFailed,
-                               fmt::format("{} cannot be written ({}).", options.output, std::strerror(errno)));
-        cards = exportTo(context, options, file);
-        file.close();
-        if (!file)
-            throw CommandError(kFailed,
-                               fmt::format("{} could not be written whole. Is the disk full?", options.output));
+        OutputFile file(options.output);
+        cards = exportTo(context, options, file.stream());
+        file.finish();
     }
     context.say(fmt::format("{} cards written.", cards));
 }
@@ -144,20 +182,21 @@ void list(Context& context, const ListOptions& options) {
     }
     // Written one by one: a document of 100,000 people with photos need not stand in memory.
     context.line("[");
-    for (size_t i = 0; i < people.size(); ++i) {
+    bool first = true;
+    for (const CXListing& listed : people) {
         Json data;
         if (options.full) {
             const auto person =
-                std::dynamic_pointer_cast<CXPerson>(context.database().recordForUniqueId(people[i].uniqueId));
-            if (!person) continue;
+                std::dynamic_pointer_cast<CXPerson>(context.database().recordForUniqueId(listed.uniqueId));
+            if (!person) continue; // deleted meanwhile
             data = toJson(*person);
         } else {
-            data = {{"identifier", people[i].uniqueId.str()},
-                    {"name", people[i].displayName},
-                    {"location", people[i].location.empty() ? Json() : Json(people[i].location.str())}};
+            data = {{"identifier", listed.uniqueId.str()},
+                    {"name", listed.displayName},
+                    {"location", listed.location.empty() ? Json() : Json(listed.location.str())}};
         }
-        context.line("  " + data.dump(-1, ' ', false, Json::error_handler_t::replace) +
-                     (i + 1 < people.size() ? "," : ""));
+        context.line(std::string(first ? "  " : ", ") + data.dump(-1, ' ', false, Json::error_handler_t::replace));
+        first = false;
     }
     context.line("]");
 }
@@ -221,7 +260,7 @@ void remove(Context& context, const std::vector<std::string>& names, bool yes) {
     CXRolvane& database = context.database();
     std::vector<CXPersonRef> people;
     for (const std::string& name : names) {
-        people.push_back(findPerson(database, name));
+        people.push_back(findPerson(database, name, true));
         refuseReadOnly(*people.back(), people.back()->displayName());
     }
     const std::string question = people.size() == 1 ? fmt::format("Delete {}?", people[0]->displayName())
@@ -278,7 +317,8 @@ void addContactCommands(CLI::App& app, Context& context) {
         app, context, "add", "Add a person; prints the identifier",
         [&](CLI::App& command) {
             added->declare(command, false);
-            command.add_option("-g,--group", *groups, "Make the person a member of this group");
+            command.add_option("-g,--group", *groups, "Make the person a member of this group")
+                ->allow_extra_args(false);
         },
         [&context, added, groups] { add(context, *added, *groups); });
 
@@ -295,7 +335,7 @@ void addContactCommands(CLI::App& app, Context& context) {
     const auto deleted = std::make_shared<std::vector<std::string>>();
     const auto yes = std::make_shared<bool>(false);
     addCommand(
-        app, context, "delete", "Delete people",
+        app, context, "delete", "Delete people; a part of a name is not enough",
         [&](CLI::App& command) {
             command.add_option("names", *deleted, "Names or identifiers")->required();
             command.add_flag("-y,--yes", *yes, "Do not ask");

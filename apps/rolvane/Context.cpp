@@ -1,5 +1,7 @@
 #include "Context.h"
 
+#include "Examples.h"
+
 #include <cmath>
 #include <fmt/format.h>
 #include <iostream>
@@ -88,10 +90,22 @@ void ProgressBar::update(double fraction, const std::string& note) {
     std::cerr << fmt::format("{} {}% {}", _label, percent, note) << "\n";
 }
 
+namespace {
+
+// "group add"; the program's own name is no part of it.
+std::string pathOf(const CLI::App& command) {
+    const CLI::App* parent = command.get_parent();
+    const bool below = parent && parent->get_parent();
+    return (below ? pathOf(*parent) + " " : "") + command.get_name();
+}
+
+} // namespace
+
 CLI::App* addCommand(CLI::App& parent, Context& context, const std::string& name, const std::string& description,
                      const std::function<void(CLI::App&)>& declare, std::function<void()> body) {
     CLI::App* command = parent.add_subcommand(name, description);
     command->fallthrough();
+    command->footer(helpFooter(pathOf(*command)));
     command->add_flag("--json", context.json, "Print data as one JSON document");
     command->add_flag("-q,--quiet", context.quiet, "No messages but errors");
     if (declare) declare(*command);

@@ -92,7 +92,9 @@ void showStatus(Context& context) {
     const auto row = [&](const std::string& label, const std::string& text) {
         context.line(fmt::format("{:<15}{}", label, text));
     };
-    row("Contacts", fmt::format("{} people, {} groups", s["people"].get<size_t>(), s["groups"].get<size_t>()));
+    const size_t people = s["people"], groups = s["groups"], pending = s["pending"];
+    row("Contacts",
+        fmt::format("{} {}, {} group{}", people, people == 1 ? "person" : "people", groups, groups == 1 ? "" : "s"));
     row("Daemon", s["daemon"].is_null() ? "not running (`rolvane daemon start`)"
                                         : fmt::format("running, process {}", s["daemon"].get<int>()));
     if (s["store"].is_null()) {
@@ -105,7 +107,7 @@ void showStatus(Context& context) {
     }
     row("Published", publishedText(s["published"]));
     row("Subscriptions", fmt::format("{}", s["subscriptions"].size()));
-    row("Waiting", fmt::format("{} changes", s["pending"].get<size_t>()));
+    row("Waiting", fmt::format("{} change{}", pending, pending == 1 ? "" : "s"));
     row("Last pass", s["lastPass"].is_null() ? "never" : s["lastPass"].get<std::string>());
 }
 
@@ -201,7 +203,7 @@ void addDaemonCommands(CLI::App& app, Context& context) {
         app, context, "watch", "Show the daemon's progress as it comes",
         [&](CLI::App& command) {
             command.add_flag("--once", options->once, "End with the first pass that ends");
-            command.add_option("--seconds", options->seconds, "End after so many seconds");
+            command.add_option("--seconds", options->seconds, "End after so many seconds")->check(CLI::PositiveNumber);
         },
         [&context, options] { watch(context, *options); });
 }

@@ -1,5 +1,6 @@
 #include "Context.h"
 #include "Lookup.h"
+#include "Publication.h"
 #include "RecordJson.h"
 
 #include "contacts/Constants.h"
@@ -21,8 +22,8 @@ struct GroupOptions {
 };
 
 // The owner's own groups can be changed; a copy from a subscription only with the right to write.
-CXGroupRef changeableGroup(CXRolvane& database, const std::string& named) {
-    const CXGroupRef group = findGroup(database, named);
+CXGroupRef changeableGroup(CXRolvane& database, const std::string& named, bool whole = false) {
+    const CXGroupRef group = findGroup(database, named, whole);
     if (group->isAllGroup())
         throw CommandError(kRefused, fmt::format("\"{}\" holds everybody; its members are not chosen.", group->name()));
     if (!group->isSubscribed()) return group;
@@ -107,8 +108,13 @@ void renameGroup(Context& context, const GroupOptions& options) {
 }
 
 void deleteGroup(Context& context, const GroupOptions& options) {
-    const CXGroupRef group = changeableGroup(context.database(), options.group);
+    const CXGroupRef group = changeableGroup(context.database(), options.group, true);
     const std::string name = group->name();
+    const Publication publication(context.database());
+    if (!publication.everything() && publication.publishes(group))
+        throw CommandError(kRefused, fmt::format("\"{}\" is published by itself. Withdraw it first, with `rolvane "
+                                                 "unpublish --group`: its files would stay on the store.",
+                                                 name));
     context.database().removeRecord(group);
     context.database().save();
     context.say(fmt::format("The group \"{}\" is deleted; its members stay.", name));
@@ -205,7 +211,8 @@ void addGroupCommands(CLI::App& app, Context& context) {
         "rename", "Give a group another name",
         [o](CLI::App& c) { c.add_option("name", o->name, "The new name")->required(); },
         [&context, o] { renameGroup(context, *o); });
-    with("delete", "Delete a group; its members stay", nullptr, [&context, o] { deleteGroup(context, *o); });
+    with("delete", "Delete a group; its members stay, and a part of its name is not enough", nullptr,
+         [&context, o] { deleteGroup(context, *o); });
     with("add", "Make people members", people, [&context, o] { changeMembers(context, *o, true); });
     with("remove", "Take members out", people, [&context, o] { changeMembers(context, *o, false); });
     with("add-group", "Put groups into a group", groups, [&context, o] { changeSubgroups(context, *o, true); });

@@ -19,7 +19,7 @@ std::string folded(std::string text) {
 
 // The listings that the words fit best: identifier, start of one, whole name, part of a name; the first rule that finds
 // any wins.
-std::vector<CXListing> matches(const std::vector<CXListing>& all, const std::string& named) {
+std::vector<CXListing> matches(const std::vector<CXListing>& all, const std::string& named, bool whole) {
     const std::string wanted = folded(named);
     const auto chosen = [&](const auto& rule) {
         std::vector<CXListing> found;
@@ -35,6 +35,7 @@ std::vector<CXListing> matches(const std::vector<CXListing>& all, const std::str
         if (auto found = chosen([&](const CXListing& l) { return folded(l.uniqueId.str()).starts_with(wanted); });
             !found.empty())
             return found;
+    if (whole) return {};
     return chosen([&](const CXListing& l) { return folded(l.displayName).find(wanted) != std::string::npos; });
 }
 
@@ -48,21 +49,21 @@ UniqueId only(const std::vector<CXListing>& found, const std::string& kind, cons
     for (size_t i = 0; i < std::min(found.size(), kShown); ++i)
         list += fmt::format("\n  {}  {}", found[i].uniqueId.str(), found[i].displayName);
     if (found.size() > kShown) list += fmt::format("\n  and {} more", found.size() - kShown);
-    throw CommandError(
-        kNotFound, fmt::format("\"{}\" fits {} {}s. Name one by its identifier:{}", named, found.size(), kind, list));
+    throw CommandError(kNotFound, fmt::format("\"{}\" fits {} {}. Name one by its identifier:{}", named, found.size(),
+                                              kind == "person" ? "people" : "groups", list));
 }
 
 } // namespace
 
-CXPersonRef findPerson(CXRolvane& database, const std::string& named) {
+CXPersonRef findPerson(CXRolvane& database, const std::string& named, bool whole) {
     if (auto exact = std::dynamic_pointer_cast<CXPerson>(database.recordForUniqueId(UniqueId(named)))) return exact;
-    const UniqueId uid = only(matches(database.listPeople(std::nullopt), named), "person", named);
+    const UniqueId uid = only(matches(database.listPeople(std::nullopt), named, whole), "person", named);
     return std::dynamic_pointer_cast<CXPerson>(database.recordForUniqueId(uid));
 }
 
-CXGroupRef findGroup(CXRolvane& database, const std::string& named) {
+CXGroupRef findGroup(CXRolvane& database, const std::string& named, bool whole) {
     if (auto exact = std::dynamic_pointer_cast<CXGroup>(database.recordForUniqueId(UniqueId(named)))) return exact;
-    const UniqueId uid = only(matches(database.listGroups(std::nullopt), named), "group", named);
+    const UniqueId uid = only(matches(database.listGroups(std::nullopt), named, whole), "group", named);
     return std::dynamic_pointer_cast<CXGroup>(database.recordForUniqueId(uid));
 }
 

@@ -9,7 +9,8 @@ namespace rolvane::cli {
 // What a person names on the command line: an identifier, the start of one (at least 4 characters), or a name (letter
 // case does not matter; an exact match wins over a part). Throws CommandError kNotFound when nothing or several match;
 // the message lists the candidates.
-CXPersonRef findPerson(CXRolvane& database, const std::string& named);
-CXGroupRef findGroup(CXRolvane& database, const std::string& named);
+// With `whole` a part of a name is not enough: for what cannot be taken back.
+CXPersonRef findPerson(CXRolvane& database, const std::string& named, bool whole = false);
+CXGroupRef findGroup(CXRolvane& database, const std::string& named, bool whole = false);
 
 } // namespace rolvane::cli

@@ -118,16 +118,20 @@ void PersonFields::declare(CLI::App& command, bool editing) {
         given.push_back(command.add_option(singles()[i].option, values[i], singles()[i].help));
     command.add_option("--birthday", birthday, "Birthday, as 1980-12-31");
     command.add_option("--photo", photo, "File with a PNG, JPEG, GIF or WebP picture");
-    command.add_option("--phone", phones, "Add a phone number, as label:number");
-    command.add_option("--email", emails, "Add a mail address, as label:address");
-    command.add_option("--url", urls, "Add a URL, as label:URL");
-    command.add_option("--address", addresses, "Add an address, as \"label:Street; ZIP; City; State; Country\"");
+    // One value each time that the option is given: what follows the value is not taken for another one.
+    const auto several = [&](const char* name, std::vector<std::string>& texts, const char* help) {
+        command.add_option(name, texts, help)->allow_extra_args(false);
+    };
+    several("--phone", phones, "Add a phone number, as label:number");
+    several("--email", emails, "Add a mail address, as label:address");
+    several("--url", urls, "Add a URL, as label:URL");
+    several("--address", addresses, "Add an address, as \"label:Street; ZIP; City; State; Country\"");
     if (!editing) return;
-    command.add_option("--remove-phone", removedPhones, "Remove a phone number, by value, label or identifier");
-    command.add_option("--remove-email", removedEmails, "Remove a mail address");
-    command.add_option("--remove-url", removedUrls, "Remove a URL");
-    command.add_option("--remove-address", removedAddresses, "Remove an address, by label or identifier");
-    command.add_option("--unset", unset, "Remove a property, by its name in `show --json`");
+    several("--remove-phone", removedPhones, "Remove a phone number, by value, label or identifier");
+    several("--remove-email", removedEmails, "Remove a mail address");
+    several("--remove-url", removedUrls, "Remove a URL");
+    several("--remove-address", removedAddresses, "Remove an address, by label or identifier");
+    several("--unset", unset, "Remove a property, by its name in `show --json`");
 }
 
 void PersonFields::applyTo(CXPerson& person) const {
@@ -152,7 +156,8 @@ void PersonFields::applyTo(CXPerson& person) const {
             throw CommandError(kNotFound, fmt::format("{} has no property {}.", person.displayName(), property));
         changes.push_back({property, Value()});
     }
-    for (const Change& change : changes) person.setValue(change.value, change.property);
+    for (const Change& change : changes) // what stays as it was is no edit, which would travel to everybody
+        if (!(person.valueForProperty(change.property) == change.value)) person.setValue(change.value, change.property);
 }
 
 } // namespace rolvane::cli

@@ -57,6 +57,10 @@ std::vector<CXGroupRef> Publication::groups() const {
     return found;
 }
 
+bool Publication::publishes(const CXGroupRef& group) const {
+    return isPublished(*group);
+}
+
 bool Publication::publishEverything(const Url& base) {
     const bool changed = publishAt(*_database.allGroup(), base);
     if (changed) settle();

@@ -23,7 +23,8 @@ public:
     explicit Publication(CXRolvane& database) : _database(database) {}
 
     bool everything() const;
-    std::vector<CXGroupRef> groups() const; // published by themselves, by name
+    std::vector<CXGroupRef> groups() const;        // published by themselves, by name
+    bool publishes(const CXGroupRef& group) const; // by itself
     bool anything() const { return everything() || !groups().empty(); }
 
     // Each is unsaved. True when it changed something.

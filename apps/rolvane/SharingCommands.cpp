@@ -21,6 +21,12 @@ constexpr const char* kDaemonProgram = "RolvaneManager";
 
 // The owner's base location; refuses without a usable account.
 Url ownBase() {
+    const auto account = CXDAVAccount::load(); // says what is wrong with one that cannot be used
+    try {
+        if (account) (void)account->password();
+    } catch (const CXException& error) {
+        throw CommandError(kRefused, error.reason());
+    }
     const std::string user = CXDAVManager::vaultraUser();
     if (user.empty())
         throw CommandError(kFailed, "There is no account on a store yet. `rolvane account set` makes one.");
@@ -40,7 +46,15 @@ void reportResult(Context& context) {
     context.warn(fmt::format("{} change{} wait{}: {}", waiting, waiting == 1 ? "" : "s", waiting == 1 ? "s" : "",
                              reachable ? "the store did not take them yet. They are tried again in the next pass."
                                        : error.reason + " They are sent when the store can be reached again."));
-    context.exitCode = reachable ? kFailed : kUnreachable;
+    context.exitCode = reachable ? kFailed : error.code == kCXDAVErrorAuthentication ? kRefused : kUnreachable;
+}
+
+// A daemon that ends in the middle would be waited for in vain.
+void requireDaemon(const DaemonControl& daemon) {
+    if (daemon.running()) return;
+    throw CommandError(kFailed, fmt::format("RolvaneManager ended before the pass was done. What is left is kept; "
+                                            "`rolvane sync` goes on with it. Its log is {}.",
+                                            DaemonControl::logPath()));
 }
 
 // Draws the daemon's progress until what was saved at that position of the journal and that date has been through a
@@ -53,10 +67,16 @@ void waitForPass(Context& context, PassWatch& watch, int64_t position, Date save
         if (event.kind == PassWatch::Event::Kind::progress) bar.update(event.fraction);
     };
     CXRolvane& database = context.database();
+    const DaemonControl daemon;
+    const auto passed = [&] {
+        const auto lastPass = Preferences::shared().get(kDaemonDomain, kCXDCXConduitLastSyncDate).date();
+        return lastPass && *lastPass > saved && database.cursorPosition(kDaemonProgram) >= position;
+    };
     const auto done = watch.waitUntil(
         [&] {
-            const auto lastPass = Preferences::shared().get(kDaemonDomain, kCXDCXConduitLastSyncDate).date();
-            return lastPass && *lastPass > saved && database.cursorPosition(kDaemonProgram) >= position;
+            if (passed()) return true;
+            requireDaemon(daemon);
+            return false;
         },
         seconds);
     watch.onEvent = nullptr;
@@ -80,6 +100,10 @@ void publish(Context& context, const PublishOptions& options) {
     Publication publication(database);
     const bool served = publication.anything();
 
+    CXDAVError error;
+    if (!CXDAVManager::canReachOstrelError(error) && error.code == kCXDAVErrorAuthentication)
+        throw CommandError(kRefused, error.reason + " Nothing was published.");
+
     PassWatch watch(context);
     const CXGroupRef group = options.group.empty() ? nullptr : findGroup(database, options.group);
     const bool changed = group ? publication.publishGroup(group, base) : publication.publishEverything(base);
@@ -98,8 +122,15 @@ void publish(Context& context, const PublishOptions& options) {
     if (options.noWait) return;
     if (!changed) return sync(context, options.timeout);
     waitForPass(context, watch, position, saved, options.timeout);
+    // A pass that the restart ended in the middle may have left a lock or a record behind.
+    if (pendingChanges() > 0 && context.bus().connected() && CXDAVManager::canReachOstrelError(error))
+        return sync(context, options.timeout);
     reportResult(context);
     if (context.exitCode == kOk) context.say("Everything is on the store.");
+}
+
+std::string answer(int code) {
+    return code == 0 ? "it did not answer" : fmt::format("it answered {}", code);
 }
 
 // Takes a group's files off the store: its state and directory, its mention in the list of groups, and the people of
@@ -109,9 +140,9 @@ void removeGroupFromStore(const Url& base, const UniqueId& group, const std::vec
     int code = 0;
     const auto refused = [&](const std::string& what) {
         throw CommandError(code == 0 ? kUnreachable : kFailed,
-                           fmt::format("{} could not be removed from the store (status {}). Run the command again "
+                           fmt::format("{} could not be removed from the store ({}). Run the command again "
                                        "when the store can be reached; nothing else was lost.",
-                                       what, code));
+                                       what, answer(code)));
     };
     const Url all = layout::groupLocation(base, UniqueId("AllCXGroup"));
     if (auto state = store.dictionaryAtURL(all, true, &code)) {
@@ -164,9 +195,9 @@ void unpublish(Context& context, const PublishOptions& options) {
                 removed = CXDAVManager::defaultManager().removeFileAtURL(base, &code);
                 if (!removed)
                     throw CommandError(code == 0 ? kUnreachable : kFailed,
-                                       fmt::format("{}, but the files at {} could not be removed (status {}). Run "
+                                       fmt::format("{}, but the files at {} could not be removed ({}). Run "
                                                    "`rolvane unpublish` again when the store can be reached.",
-                                                   done, base.absoluteString(), code));
+                                                   done, base.absoluteString(), answer(code)));
             } else {
                 removeGroupFromStore(base, cxNormalizedUID(group->uniqueId()), people);
                 removed = true;
@@ -204,7 +235,12 @@ void sync(Context& context, double seconds) {
             if (event.kind == PassWatch::Event::Kind::progress) bar.update(event.fraction);
             if (event.kind == PassWatch::Event::Kind::started && stoppedBefore < 0) stoppedBefore = watch.stopped();
         };
-        if (!watch.waitUntil([&] { return stoppedBefore >= 0 && watch.stopped() > stoppedBefore; }, seconds))
+        const auto passed = [&] {
+            const bool done = stoppedBefore >= 0 && watch.stopped() > stoppedBefore;
+            if (!done) requireDaemon(daemon);
+            return done;
+        };
+        if (!watch.waitUntil(passed, seconds))
             throw CommandError(kUnreachable, fmt::format("No pass ended within {} seconds. `rolvane daemon status` "
                                                          "tells whether the daemon is at work.",
                                                          seconds));
@@ -224,7 +260,9 @@ void addSharingCommands(CLI::App& app, Context& context) {
             command.add_option("-g,--group", options->group, "Publish this group only (name or identifier)");
             command.add_flag("--no-wait", options->noWait, "Return as soon as the daemon is at work");
             command.add_flag("--no-daemon", options->noDaemon, "Only note it; do not start the daemon");
-            command.add_option("--timeout", options->timeout, "Seconds to wait for the pass")->capture_default_str();
+            command.add_option("--timeout", options->timeout, "Seconds to wait for the pass")
+                ->check(CLI::PositiveNumber)
+                ->capture_default_str();
         },
         [&context, options] { publish(context, *options); });
     addCommand(
@@ -238,7 +276,9 @@ void addSharingCommands(CLI::App& app, Context& context) {
     addCommand(
         app, context, "sync", "Make a pass now and wait for its end",
         [&](CLI::App& command) {
-            command.add_option("--timeout", *seconds, "Seconds to wait for the pass")->capture_default_str();
+            command.add_option("--timeout", *seconds, "Seconds to wait for the pass")
+                ->check(CLI::PositiveNumber)
+                ->capture_default_str();
         },
         [&context, seconds] { sync(context, *seconds); });
 }

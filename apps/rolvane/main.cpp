@@ -13,7 +13,52 @@ constexpr const char* kFooter = R"(Exit codes:
   2  wrong command line        6  the store or the daemon was not reached in time
   3  no such thing, or several of that name
 
-Data goes to standard output, messages to standard error. `rolvane COMMAND --help` tells more.)";
+Data goes to standard output, messages to standard error. `rolvane COMMAND --help` tells more.
+
+Examples:
+  rolvane import friends.vcf
+  rolvane store start && rolvane store user add alice
+  rolvane account set --user alice --endpoint ... --ca-file ... --ask-password
+  rolvane publish && rolvane watch)";
+
+// Where the words of the line lead: the innermost command, and the word that is no command where one is needed.
+struct Named {
+    const CLI::App* command;
+    std::string unknown;
+};
+
+Named namedCommand(const CLI::App& app, int argc, char** argv) {
+    const auto isCommand = [](const CLI::App* c) { return !c->get_name().empty(); }; // a group of options has no name
+    const CLI::App* command = &app;
+    for (int i = 1; i < argc && !command->get_subcommands(isCommand).empty(); ++i) {
+        const std::string word = argv[i];
+        if (word.starts_with('-')) continue;
+        const auto below = command->get_subcommands([&](const CLI::App* c) { return c->get_name() == word; });
+        if (below.empty()) return {command, word};
+        command = below.front();
+    }
+    return {command, {}};
+}
+
+std::string nameOf(const CLI::App& command) {
+    return (command.get_parent() ? nameOf(*command.get_parent()) + " " : "") + command.get_name();
+}
+
+// Help and version go to standard output; what is wrong with the line goes to standard error, with what to do.
+int endWith(const CLI::App& app, const CLI::ParseError& error, int argc, char** argv) {
+    using namespace rolvane::cli;
+    if (error.get_exit_code() == 0) return app.exit(error);
+    if (argc == 1) {
+        std::cerr << app.help();
+        return kUsage;
+    }
+    const auto [command, unknown] = namedCommand(app, argc, argv);
+    std::string what =
+        unknown.empty() ? error.what() : "There is no command \"" + nameOf(*command) + " " + unknown + "\"";
+    if (what.ends_with('.')) what.pop_back();
+    std::cerr << "rolvane: " << what << ". `" << nameOf(*command) << " --help` shows what can be given.\n";
+    return kUsage;
+}
 
 } // namespace
 
@@ -46,8 +91,7 @@ int main(int argc, char** argv) {
         }
         return context.exitCode;
     } catch (const CLI::ParseError& error) {
-        const int code = app.exit(error);
-        return code == 0 ? kOk : kUsage;
+        return endWith(app, error, argc, argv);
     } catch (const CommandError& error) {
         std::cerr << "rolvane: " << error.reason() << "\n";
         return error.code();

@@ -81,7 +81,6 @@ CheckInPorts CXDCheckIn(RunLoop& loop) {
             ports._sources.push_back(std::make_shared<RunLoop::Handle>(
                 loop.addPort(ports._idle, [fd = ports._idle](uint32_t) { drain(fd); })));
     }
-    sd_notify(0, "READY=1");
     return ports;
 }
 

@@ -27,7 +27,7 @@ private:
 
 // Checks in with the service launcher (sd_listen_fds) and schedules each socket that it passed as a source of the loop.
 // Started without a launcher, or handed nothing usable, the process gets an idle source of its own, so that the loop
-// waits all the same. Failures are silent. Tells the launcher that the daemon is ready (sd_notify).
+// waits all the same. Failures are silent.
 CheckInPorts CXDCheckIn(RunLoop& loop);
 
 } // namespace rolvane

@@ -168,7 +168,9 @@ int runDaemon(int argc, char** argv) {
         const CheckInPorts ports = CXDCheckIn(RunLoop::current());
 
         daemon.openDatabase();
-        if (daemon.publishes() || daemon.subscribes()) daemon.firstPass();
+        const bool shares = daemon.publishes() || daemon.subscribes();
+        sd_notify(0, "READY=1"); // its files can be used; the first pass may take long
+        if (shares) daemon.firstPass();
         CXDSyncEngine::persist();
         CXDLog("Entering main run loop.");
         daemon.serve();

@@ -118,9 +118,10 @@ std::string ownDirectory() {
 
 std::string logTail(const std::string& path, size_t bytes) {
     try {
-        const std::string text = readFile(path);
+        std::string text = readFile(path);
+        if (text.ends_with('\n')) text.pop_back();
         const std::string tail = text.size() > bytes ? text.substr(text.size() - bytes) : text;
-        const size_t lastLine = tail.find_last_of('\n', tail.size() < 2 ? 0 : tail.size() - 2);
+        const size_t lastLine = tail.find_last_of('\n');
         return lastLine == std::string::npos ? tail : tail.substr(lastLine + 1);
     } catch (const CXException&) {
         return {};

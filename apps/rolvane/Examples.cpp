@@ -1,0 +1,61 @@
+#include "Examples.h"
+
+#include <map>
+
+namespace rolvane::cli {
+
+namespace {
+
+const std::map<std::string, const char*>& examples() {
+    static const std::map<std::string, const char*> all{
+        {"import", "  rolvane import friends.vcf work.vcf\n"
+                   "  curl https://example.org/team.vcf | rolvane import -"},
+        {"export", "  rolvane export -o everybody.vcf\n"
+                   "  rolvane export --group Family --vcard 3 > family.vcf"},
+        {"list", "  rolvane list miller\n"
+                 "  rolvane list --group Family --json --full"},
+        {"show", "  rolvane show \"Ada Miller\"\n"
+                 "  rolvane show 4CA70A2B --json"},
+        {"add", "  rolvane add --first Ada --last Miller --phone \"mobile:+1 555 0100\" --group Family"},
+        {"edit", "  rolvane edit \"Ada Miller\" --email work:ada@example.org --note \"\""},
+        {"delete", "  rolvane delete \"Ada Miller\" --yes"},
+        {"group create", "  rolvane group create Family \"Ada Miller\" \"Bob Miller\""},
+        {"group add", "  rolvane group add Family \"Ada Miller\""},
+        {"group remove", "  rolvane group remove Family \"Ada Miller\""},
+        {"group add-group", "  rolvane group add-group Family Cousins"},
+        {"group rename", "  rolvane group rename Family Kin"},
+        {"group choose", "  rolvane group choose Family \"Ada Miller\" Email Home\n"
+                         "  rolvane group choose Family \"Ada Miller\" Email --clear"},
+        {"account set", "  rolvane account set --user ada --endpoint 'https://dav.example.org/dav/{user}/Contacts' \\\n"
+                        "      --password-command 'pass show dav.example.org'\n"
+                        "  rolvane account set --password-file ~/.config/rolvane/password"},
+        {"account test", "  rolvane account test && rolvane publish"},
+        {"publish", "  rolvane publish\n"
+                    "  rolvane publish --group Family"},
+        {"unpublish", "  rolvane unpublish --group Family\n"
+                      "  rolvane unpublish --keep"},
+        {"sync", "  rolvane sync --timeout 60"},
+        {"daemon", "  rolvane daemon start\n"
+                   "  rolvane daemon status --json"},
+        {"status", "  rolvane status --json"},
+        {"watch", "  rolvane watch\n"
+                  "  rolvane watch --json --once --seconds 60"},
+        {"defaults read", "  rolvane defaults read\n"
+                          "  rolvane defaults read CXDShareCount"},
+        {"defaults write", "  rolvane defaults write CXDDebugLevel 1 --type int"},
+        {"store start", "  rolvane store start\n"
+                        "  rolvane store start --directory ~/stores/work --port 8443"},
+        {"store user add", "  rolvane store user add alice"},
+    };
+    return all;
+}
+
+} // namespace
+
+std::string helpFooter(const std::string& path) {
+    const auto found = examples().find(path);
+    const std::string codes = "`rolvane --help` lists the exit codes.";
+    return found == examples().end() ? codes : "Examples:\n" + std::string(found->second) + "\n\n" + codes;
+}
+
+} // namespace rolvane::cli
