@@ -172,7 +172,7 @@ TEST_F(StartUp, AnEditOfAnotherProcessIsCarriedToTheStore) {
     world.publishEverything();
     const auto daemon = world.serving();
     world.addPeople(1, "Newcomer");
-    for (int i = 0; i < 200 && !world.differences().empty(); ++i) daemon->wait(0.05);
+    for (int i = 0; i < 600 && !world.differences().empty(); ++i) daemon->wait(0.05);
     EXPECT_EQ(world.differences(), "") << daemon->errors();
 }
 
