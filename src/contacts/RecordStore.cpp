@@ -261,25 +261,36 @@ std::optional<std::string> RecordStore::choice(const UniqueId& group, const Uniq
     return s.text(0);
 }
 
+// In two steps, each of which finds its place by index: the rest of the rows with the position's own date, then the
+// rows behind that date. One save gives all its records one date, so that a comparison of (date, number) pairs would
+// walk over the whole save again for every page.
 std::vector<CXRow> RecordStore::scan(RecordKind kind, ScanPosition& position, int limit, bool withParents) {
     SqliteSnapshot snapshot(_database);
-    auto s = _database.statement("SELECT id, uid, location, created, modified, properties FROM records "
-                                 "WHERE kind=?1 AND (modified, id) > (?2, ?3) ORDER BY modified, id LIMIT ?4");
-    s.bind(1, static_cast<int>(kind)).bind(2, position.modified).bind(3, position.id).bind(4, limit);
     std::vector<CXRow> rows;
     std::vector<int64_t> ids;
-    while (s.step()) {
-        CXRow row;
-        row.uniqueId = UniqueId(s.text(1));
-        row.sharingUniqueId = cxNormalizedUID(row.uniqueId);
-        row.location = RemoteLocation(s.text(2));
-        row.created = Date(s.real(3));
-        row.modified = Date(s.real(4));
-        row.encoded = std::make_shared<const Bytes>(s.bytes(5));
-        position = {s.real(4), s.integer(0)};
-        ids.push_back(position.id);
-        rows.push_back(std::move(row));
-    }
+    const double date = position.modified;
+    const auto take = [&](Sqlite::Statement& s) {
+        while (s.step()) {
+            CXRow row;
+            row.uniqueId = UniqueId(s.text(1));
+            row.sharingUniqueId = cxNormalizedUID(row.uniqueId);
+            row.location = RemoteLocation(s.text(2));
+            row.created = Date(s.real(3));
+            row.modified = Date(s.real(4));
+            row.encoded = std::make_shared<const Bytes>(s.bytes(5));
+            position = {s.real(4), s.integer(0)};
+            ids.push_back(position.id);
+            rows.push_back(std::move(row));
+        }
+    };
+    auto sameDate = _database.statement("SELECT id, uid, location, created, modified, properties FROM records "
+                                        "WHERE kind=?1 AND modified=?2 AND id>?3 ORDER BY id LIMIT ?4");
+    sameDate.bind(1, static_cast<int>(kind)).bind(2, date).bind(3, position.id).bind(4, limit);
+    take(sameDate);
+    auto later = _database.statement("SELECT id, uid, location, created, modified, properties FROM records "
+                                     "WHERE kind=?1 AND modified>?2 ORDER BY modified, id LIMIT ?3");
+    later.bind(1, static_cast<int>(kind)).bind(2, date).bind(3, limit - static_cast<int>(rows.size()));
+    take(later);
     if (withParents) addParents(rows, ids);
     return rows;
 }

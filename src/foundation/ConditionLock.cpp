@@ -26,37 +26,71 @@ int ConditionLock::condition() const {
     return _condition;
 }
 
+// In the queue for as long as it lives. With the mutex held.
+class ConditionLock::Queued {
+public:
+    Queued(ConditionLock& lock, std::optional<int> condition)
+        : waiter{{}, condition}, _waiting(lock._waiting), _place(_waiting.insert(_waiting.end(), &waiter)) {}
+    ~Queued() { _waiting.erase(_place); }
+    Queued(const Queued&) = delete;
+    Queued& operator=(const Queued&) = delete;
+
+    Waiter waiter;
+
+private:
+    std::list<Waiter*>& _waiting;
+    const std::list<Waiter*>::iterator _place;
+};
+
 void ConditionLock::lock() {
     std::unique_lock guard(_mutex);
-    _changed.wait(guard, [&] { return !_held; });
+    if (_held) {
+        Queued queued(*this, std::nullopt);
+        queued.waiter.wake.wait(guard, [&] { return !_held; });
+    }
     _held = true;
 }
 
 void ConditionLock::lockWhenCondition(int condition) {
     std::unique_lock guard(_mutex);
-    _changed.wait(guard, [&] { return !_held && _condition == condition; });
+    if (!isFreeFor(condition)) {
+        Queued queued(*this, condition);
+        queued.waiter.wake.wait(guard, [&] { return isFreeFor(condition); });
+    }
     _held = true;
 }
 
 bool ConditionLock::lockWhenCondition(int condition, double timeoutSeconds) {
     std::unique_lock guard(_mutex);
-    if (!_changed.wait_until(guard, deadlineAfter(timeoutSeconds), [&] { return !_held && _condition == condition; }))
-        return false;
+    if (!isFreeFor(condition)) {
+        Queued queued(*this, condition);
+        if (!queued.waiter.wake.wait_until(guard, deadlineAfter(timeoutSeconds), [&] { return isFreeFor(condition); }))
+            return false;
+    }
     _held = true;
     return true;
 }
 
-void ConditionLock::unlock() {
-    std::lock_guard guard(_mutex); // held while notifying: the one who wakes may destroy the lock
+// Who was woken but finds that somebody came in between waits on, and the release of that one wakes again. The mutex is
+// held while notifying: the one who wakes may destroy the lock.
+void ConditionLock::release() {
     _held = false;
-    _changed.notify_all();
+    for (Waiter* waiter : _waiting) {
+        if (!isFreeFor(waiter->condition)) continue;
+        waiter->wake.notify_one();
+        return;
+    }
+}
+
+void ConditionLock::unlock() {
+    std::lock_guard guard(_mutex);
+    release();
 }
 
 void ConditionLock::unlockWithCondition(int condition) {
     std::lock_guard guard(_mutex);
     _condition = condition;
-    _held = false;
-    _changed.notify_all();
+    release();
 }
 
 } // namespace rolvane

@@ -3,7 +3,9 @@
 #include "foundation/Date.h"
 
 #include <condition_variable>
+#include <list>
 #include <mutex>
+#include <optional>
 
 namespace rolvane {
 
@@ -24,8 +26,19 @@ public:
     void unlockWithCondition(int condition);
 
 private:
+    // A release wakes one of those who wait for what it leaves behind, and nobody who would only look and wait on.
+    struct Waiter {
+        std::condition_variable wake;
+        std::optional<int> condition; // none: any
+    };
+    class Queued;
+    bool isFreeFor(const std::optional<int>& condition) const {
+        return !_held && (!condition || *condition == _condition);
+    }
+    void release();
+
     mutable std::mutex _mutex;
-    std::condition_variable _changed;
+    std::list<Waiter*> _waiting; // the longest wait first
     int _condition;
     bool _held = false;
 };
