@@ -79,7 +79,10 @@ CXFileManager* CXDVaultraConduit::defaultManager() const {
 
 std::optional<Url> CXDVaultraConduit::baseLocationForUser(const std::optional<UserName>& user) const {
     if (!user) return std::nullopt;
-    return _world.manager.account().baseLocationFor(*user);
+    const std::lock_guard guard(_basesLock);
+    const auto [found, isNew] = _bases.try_emplace(*user);
+    if (isNew) found->second = _world.manager.account().baseLocationFor(*user);
+    return found->second;
 }
 
 std::optional<Url> CXDVaultraConduit::baseLocationOf(const CXDChangeRecord& record) const {

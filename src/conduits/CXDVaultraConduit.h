@@ -6,7 +6,9 @@
 #include <atomic>
 #include <functional>
 #include <memory>
+#include <mutex>
 #include <string>
+#include <unordered_map>
 
 namespace rolvane {
 
@@ -97,6 +99,9 @@ private:
 
     World _world;
     std::atomic<bool> _vaultraOffLine = false;
+    // The account is the manager's for good, and every record asks for its user's base location several times.
+    mutable std::mutex _basesLock;
+    mutable std::unordered_map<UserName, Url> _bases; // guarded by _basesLock
     ObservationHandle _simulated, _networkChanged;
 };
 

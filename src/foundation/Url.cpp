@@ -3,6 +3,7 @@
 #include "foundation/CXException.h"
 
 #include <algorithm>
+#include <array>
 #include <charconv>
 #include <fmt/format.h>
 
@@ -12,17 +13,24 @@ namespace {
 
 constexpr std::string_view kHexDigits = "0123456789ABCDEF";
 
-bool isAlpha(char c) {
+constexpr bool isAlpha(char c) {
     return (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z');
 }
-bool isDigit(char c) {
+constexpr bool isDigit(char c) {
     return c >= '0' && c <= '9';
 }
-bool isUnreserved(char c) {
+constexpr bool isUnreserved(char c) {
     return isAlpha(c) || isDigit(c) || c == '-' || c == '.' || c == '_' || c == '~';
 }
+constexpr std::array<bool, 256> kUrlCharacters = [] {
+    std::array<bool, 256> all{};
+    for (const char c : std::string_view(":/?#[]@!$&'()*+,;=%")) all[static_cast<uint8_t>(c)] = true;
+    for (int c = 0; c < 128; ++c)
+        if (isUnreserved(static_cast<char>(c))) all[static_cast<size_t>(c)] = true;
+    return all;
+}();
 bool isUrlCharacter(char c) {
-    return isUnreserved(c) || std::string_view(":/?#[]@!$&'()*+,;=%").find(c) != std::string_view::npos;
+    return kUrlCharacters[static_cast<uint8_t>(c)];
 }
 
 int hexValue(char c) {
