@@ -91,8 +91,8 @@ private:
 // Nothing when the property is unknown to the class of the table; used by resetWithDictionary and vCard.
 enum class CXPropertyType { string, date, data, boolean, array, multiString, multiDate, multiDictionary, multiAny };
 std::optional<CXPropertyType> cxPropertyType(std::string_view table, std::string_view property);
-// A copy of the value, containers new, whose texts can stand on a store: characters that an XML document cannot carry are
-// left out, bytes that are no UTF-8 become U+FFFD. What setValue and resetWithDictionary store.
+// A copy of the value, containers new, whose texts can stand on a store: characters that an XML document cannot carry
+// are left out, bytes that are no UTF-8 become U+FFFD. What setValue and resetWithDictionary store.
 Value cxCarriableValue(const Value& value);
 // What resetWithDictionary stores: a new dictionary.
 Dictionary cxSanitizedProperties(std::string_view table, const Dictionary& dictionary, bool skipUnknownProperties,

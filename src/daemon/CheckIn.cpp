@@ -2,6 +2,7 @@
 
 #include <cerrno>
 #include <fcntl.h>
+#include <map>
 #include <memory>
 #include <sys/eventfd.h>
 #include <sys/socket.h>
@@ -28,16 +29,29 @@ bool endsWithItsPeer(int fd) {
     return sd_is_fifo(fd, nullptr) > 0 || sd_is_socket(fd, AF_UNSPEC, SOCK_STREAM, 0) > 0;
 }
 
-// A message on demand: its only meaning is that the daemon is wanted, and it runs already.
-void drainListeningSocket(int fd) {
+// Peers whose message has not come yet, with the sources that wait for it.
+using Peers = std::map<int, RunLoop::Handle>;
+
+void letGo(Peers& peers, int peer) {
+    peers.erase(peer);
+    ::close(peer);
+}
+
+// A message on demand: its only meaning is that the daemon is wanted, and it runs already. It is read once it has come,
+// so that its sender is not cut off, and forgotten. A peer that says nothing gives way when there are too many.
+void acceptPeers(RunLoop& loop, int fd, const std::shared_ptr<Peers>& peers) {
+    constexpr size_t kMostWaiting = 64;
     for (;;) {
         const int peer = ::accept4(fd, nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK);
         if (peer < 0) {
             if (errno == EINTR || errno == ECONNABORTED) continue;
             return;
         }
-        drain(peer);
-        ::close(peer);
+        if (peers->size() == kMostWaiting) letGo(*peers, peers->begin()->first);
+        (*peers)[peer] = loop.addPort(peer, [peer, own = std::weak_ptr(peers)](uint32_t) {
+            drain(peer);
+            if (const auto held = own.lock()) letGo(*held, peer);
+        });
     }
 }
 
@@ -66,9 +80,10 @@ CheckInPorts CXDCheckIn(RunLoop& loop) {
         makeNonBlocking(fd);
         const bool mayEnd = !listening && endsWithItsPeer(fd);
         const auto source = std::make_shared<RunLoop::Handle>();
-        *source = loop.addPort(fd, [fd, listening, mayEnd, own = std::weak_ptr(source)](uint32_t) {
+        const auto peers = std::make_shared<Peers>();
+        *source = loop.addPort(fd, [&loop, fd, listening, mayEnd, peers, own = std::weak_ptr(source)](uint32_t) {
             if (listening)
-                drainListeningSocket(fd);
+                acceptPeers(loop, fd, peers);
             else if (!drain(fd) && mayEnd)
                 if (const auto held = own.lock()) held->reset();
         });

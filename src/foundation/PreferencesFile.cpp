@@ -146,8 +146,10 @@ void PreferencesFile::open() {
 }
 
 void PreferencesFile::checkFormat() {
-    int64_t application = number("PRAGMA application_id"), version = number("PRAGMA user_version");
+    execute("BEGIN"); // one view of the file: another process may be making it now
     int64_t tables = number("SELECT count(*) FROM sqlite_master");
+    int64_t application = number("PRAGMA application_id"), version = number("PRAGMA user_version");
+    execute("COMMIT");
     if (tables == 0) return; // new, or cut off before its first transaction
     if (application != kApplicationID)
         failWith(

@@ -194,7 +194,8 @@ TEST(VCardOracle, QuotedPrintableOfOldCardsReadsTheSame) {
                        ";\r\nFN;QUOTED-PRINTABLE:J=C3=B6rg\r\n"
                        "TEL;HOME;VOICE:+49 30 23125 001\r\nTEL;CELL:+49 30 23125 002\r\nEND:VCARD";
     View theirs = viewOf(parse(text).get());
-    // The names are stated here, because getting at decoded text is another call of the library's; the rest is compared.
+    // The names are stated here, because getting at decoded text is another call of the library's; the rest is
+    // compared.
     theirs.name = {"Müller", "Jörg"};
     theirs.formattedName = "Jörg";
     EXPECT_EQ(ourView(text + "\r\n"), theirs);
