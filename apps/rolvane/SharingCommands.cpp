@@ -213,14 +213,8 @@ void unpublish(Context& context, const PublishOptions& options) {
                                        : "."));
 }
 
-void sync(Context& context, double seconds) {
-    Publication publication(context.database());
-    bool subscribed = false;
-    for (const CXSubscriptionRef& s : context.database().subscriptions()) subscribed = subscribed || !s->isLocal();
-    if (!publication.anything() && !subscribed) {
-        context.say("Nothing is published and nobody is subscribed to: there is nothing to bring up to date.");
-        return;
-    }
+// One pass, to its end: the running daemon's, or one of its own where none runs.
+void makePass(Context& context, double seconds) {
     const DaemonControl daemon;
     if (!daemon.running()) {
         daemon.runOnce(seconds);
@@ -246,6 +240,20 @@ void sync(Context& context, double seconds) {
                                                          seconds));
         watch.onEvent = nullptr;
     }
+}
+
+void sync(Context& context, double seconds) {
+    Publication publication(context.database());
+    bool subscribed = false;
+    for (const CXSubscriptionRef& s : context.database().subscriptions()) subscribed = subscribed || !s->isLocal();
+    if (!publication.anything() && !subscribed) {
+        context.say("Nothing is published and nobody is subscribed to: there is nothing to bring up to date.");
+        return;
+    }
+    makePass(context, seconds);
+    // A record that met a lock of its tree waits for the next pass, and so may a connection that a restart has cut.
+    CXDAVError error;
+    if (pendingChanges() > 0 && CXDAVManager::canReachOstrelError(error)) makePass(context, seconds);
     reportResult(context);
     if (context.exitCode == kOk) context.say("Everything is up to date.");
 }

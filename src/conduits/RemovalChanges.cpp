@@ -81,7 +81,7 @@ CXDChangeRecords RemovalChanges::changesToRemoveGroup(const UniqueId& group) con
         const Dictionary known = groups.dictionary();
         // The records keep the order of the state: the group itself stands among the groups that list it.
         bool announced = !known.contains(group.str());
-        const auto announce = [&] {
+        const auto announce = [&, &user = user] {
             add(records, CXDDeleteGroup, user, std::nullopt, group);
             announced = true;
         };
