@@ -141,7 +141,7 @@ std::string CXACLManager::bucketNameForUID(const UniqueId& uid) {
 }
 
 std::string CXACLManager::description() const {
-    const std::string inherited = CXFormat("<CXACLManager: 0x%x>", reinterpret_cast<uintptr_t>(this));
+    const std::string inherited = CXFormat("<%s: 0x%x>", className(), reinterpret_cast<uintptr_t>(this));
     return CXFormat("%@\nReaders: %@\nWriters: %@", inherited, _readAccessPrincipals, _allAccessPrincipals);
 }
 

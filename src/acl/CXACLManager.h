@@ -20,8 +20,7 @@ public:
 // Principals are account names; "<self>" stands for the current user. One thread at a time.
 class CXACLManager {
 public:
-    // initWithBaseLocation:. Does not call load: a base constructor cannot reach a subclass's. `make` functions of the
-    // subclasses construct and load.
+    // initWithBaseLocation:. The constructors of the subclasses load; here there is nothing to load.
     CXACLManager(Url baseLocation, const LocationOwner& owner);
     virtual ~CXACLManager() = default;
 
@@ -53,6 +52,8 @@ public:
     virtual std::string description() const;
 
 protected:
+    virtual const char* className() const { return "CXACLManager"; }
+
     Url _baseLocation;
     bool _publisher;
     std::vector<UserName> _readAccessPrincipals;
