@@ -2,18 +2,13 @@
 
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
-#include "foundation/Paths.h"
 #include "foundation/PropertyList.h"
 #include "store/CXDAVManager.h"
+#include "store/LocalFiles.h"
 
 #include <cerrno>
-#include <cstring>
-#include <fcntl.h>
-#include <filesystem>
 #include <mutex>
 #include <strings.h>
-#include <sys/stat.h>
-#include <unistd.h>
 
 namespace rolvane {
 
@@ -24,18 +19,27 @@ bool isRemote(const Url& url) {
     return strcasecmp(scheme.c_str(), "http") == 0 || strcasecmp(scheme.c_str(), "https") == 0;
 }
 
+// Only a plain absence or refusal is told as one: readers take 404 and 403 for the end of a subscription.
 int codeForErrno(int error) {
+    if (error == 0) return 200;
     if (error == ENOENT || error == ENOTDIR) return 404;
     if (error == EACCES || error == EPERM) return 403;
     return 500;
 }
 
+// The local path of a file URL, "" when it names none.
+std::string localPath(const Url& url) {
+    try {
+        return url.filePath();
+    } catch (const CXException&) {
+        return {};
+    }
+}
+
 // A group's folder keeps its state file inside, as on a store.
-std::string fileAt(const Url& url) {
-    const std::string path = url.path();
-    struct stat st;
-    if (stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode)) return path + "/" + CXDAVManager::kStateName;
-    return path;
+std::string fileAt(const LocalFiles& files, const Url& url) {
+    const std::string path = localPath(url);
+    return files.isDirectory(path) ? path + "/" + CXDAVManager::kStateName : path;
 }
 
 std::mutex handlerMutex;
@@ -43,20 +47,19 @@ std::function<void()> passwordHandler;
 
 } // namespace
 
+CXFileManager::CXFileManager() : _local(std::make_shared<LocalFiles>()) {}
+CXFileManager::CXFileManager(std::string root) : _local(std::make_shared<LocalFiles>(std::move(root))) {}
+CXFileManager::~CXFileManager() = default;
+
 std::optional<Dictionary> CXFileManager::dictionaryAtURL(const Url& url, int* errorCode, bool securely) {
     if (isRemote(url)) return CXDAVManager::defaultManager().dictionaryAtURL(url, errorCode, securely);
-    int unused = 0;
-    int& code = errorCode ? *errorCode : unused;
-    const std::string path = fileAt(url);
-    const int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK);
-    if (fd < 0) {
-        code = codeForErrno(errno);
-        return std::nullopt;
-    }
-    close(fd);
-    code = 200;
+    const std::string path = fileAt(*_local, url);
+    std::string contents;
+    const int code = codeForErrno(_local->read(path, contents));
+    if (errorCode) *errorCode = code;
+    if (code != 200) return std::nullopt;
     try {
-        const Value value = PropertyList::fromXML(readFile(path));
+        const Value value = PropertyList::fromXML(contents);
         if (const Dictionary* d = value.dictionaryIf()) return *d;
     } catch (const CXException& e) {
         CXDLog("No dictionary at %@: %@", path, e.reason());
@@ -66,42 +69,21 @@ std::optional<Dictionary> CXFileManager::dictionaryAtURL(const Url& url, int* er
 
 bool CXFileManager::write(const std::string& text, const Url& url, bool securely) {
     if (isRemote(url)) return CXDAVManager::defaultManager().write(text, url, securely);
-    const int fd = open(fileAt(url).c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0666);
-    if (fd < 0) return false;
-    size_t at = 0;
-    while (at < text.size()) {
-        const ssize_t n = ::write(fd, text.data() + at, text.size() - at);
-        if (n < 0 && errno == EINTR) continue;
-        if (n <= 0) break;
-        at += static_cast<size_t>(n);
-    }
-    return close(fd) == 0 && at == text.size();
+    return _local->write(fileAt(*_local, url), text) == 0;
 }
 
 bool CXFileManager::removeDirectoryAndContentsAtURL(const Url& url) {
     if (isRemote(url)) return CXDAVManager::defaultManager().removeDirectoryAndContentsAtURL(url);
-    std::error_code error;
-    std::filesystem::remove_all(url.path(), error);
-    return !error;
+    const int error = _local->removeTree(localPath(url));
+    return error == 0 || error == ENOENT;
 }
 
 std::optional<FileListing> CXFileManager::infoForFilesInContainer(const Url& url) {
     if (isRemote(url)) return CXDAVManager::defaultManager().infoForFilesInContainer(url);
-    std::error_code error;
     FileListing out;
-    for (const auto& entry : std::filesystem::directory_iterator(url.path(), error)) {
-        struct stat st;
-        if (lstat(entry.path().c_str(), &st) != 0) continue;
-        FileInfo info;
-        info.displayName = entry.path().filename().string();
-        if (info.displayName == CXDAVManager::kStateName) continue;
-        info.isCollection = S_ISDIR(st.st_mode);
-        info.size = static_cast<uint64_t>(st.st_size);
-        info.modificationdate =
-            Date(static_cast<double>(st.st_mtim.tv_sec) + static_cast<double>(st.st_mtim.tv_nsec) / 1e9);
-        out[entry.path().string()] = std::move(info);
-    }
-    return error ? std::nullopt : std::optional(std::move(out));
+    if (_local->list(localPath(url), out) != 0) return std::nullopt;
+    std::erase_if(out, [](const auto& entry) { return entry.second.displayName == CXDAVManager::kStateName; });
+    return out;
 }
 
 void CXFileManager::setFailedPasswordHandler(std::function<void()> handler) {

@@ -7,10 +7,13 @@
 
 #include <functional>
 #include <map>
+#include <memory>
 #include <optional>
 #include <string>
 
 namespace rolvane {
+
+class LocalFiles;
 
 // One entry of a container's listing.
 struct FileInfo {
@@ -27,9 +30,14 @@ using FileListing = std::map<std::string, FileInfo>;
 // CXDAVManager::defaultManager (whose class serves them itself). Any thread. Nothing throws for what a file or a server
 // does; a failure is the absent or false result, with a code where there is an out-argument:
 // an HTTP status for remote URLs (0: no believable answer came); for file URLs 200, 404, 403 or 500.
+// Local files: a symbolic link in the place of a file or folder is never followed, and only regular files are read and
+// written; see LocalFiles.
 class CXFileManager {
 public:
-    virtual ~CXFileManager() = default;
+    CXFileManager();
+    // Serves only file URLs below the directory, which other people may write to: no link is followed below it.
+    explicit CXFileManager(std::string root);
+    virtual ~CXFileManager();
 
     // The property list dictionary stored at the URL. The code is set in every case when it is given.
     virtual std::optional<Dictionary> dictionaryAtURL(const Url& url, int* errorCode, bool securely);
@@ -39,13 +47,16 @@ public:
     virtual bool removeDirectoryAndContentsAtURL(const Url& url);
     // What lies in the container, complete or nothing. A remote base location also lists the contact files in the
     // buckets below its "People"; other containers list their own entries only. Entries with hostile names are left
-    // out.
+    // out, as are local links, pipes and devices.
     virtual std::optional<FileListing> infoForFilesInContainer(const Url& url);
 
     // Called, on the thread that needed it, when the network store's password cannot be obtained. One a process; an
     // empty function takes it away.
     static void setFailedPasswordHandler(std::function<void()> handler);
     static void failedToGetPassword(); // calls the handler, if there is one
+
+private:
+    std::shared_ptr<const LocalFiles> _local;
 };
 
 } // namespace rolvane

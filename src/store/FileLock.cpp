@@ -84,7 +84,7 @@ private:
 
     // The lock file's text, or "" when there is none.
     static std::string textOf(const std::string& path) {
-        const int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK);
+        const int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOFOLLOW);
         if (fd < 0) return {};
         char buffer[256];
         const ssize_t n = read(fd, buffer, sizeof buffer);
@@ -103,7 +103,7 @@ private:
         double until = line == std::string::npos ? 0 : atof(text.c_str() + line + 1);
         if (until <= 0) { // somebody else's file: it counts as a lock from its own date on
             struct stat st;
-            if (stat(_path.c_str(), &st) != 0) return errno == ENOENT;
+            if (lstat(_path.c_str(), &st) != 0) return errno == ENOENT;
             until = static_cast<double>(st.st_mtim.tv_sec) + lockTimeout();
         }
         if (until > _clock.now().secondsSince1970()) return false;
