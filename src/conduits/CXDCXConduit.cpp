@@ -51,10 +51,6 @@ void CXDCXConduit::setKillSwitch() {
     _readOnlyKillSwitch = !writers || writers->empty();
 }
 
-bool CXDCXConduit::applyChangeRecord(const CXDChangeRecordPtr& /*record*/, bool* /*denied*/) {
-    return false;
-}
-
 Dictionary CXDCXConduit::priorState() const {
     return engine().conduitObjectForKey(kConduitCX, kPriorState);
 }
@@ -64,6 +60,7 @@ Dictionary CXDCXConduit::priorState() const {
 void CXDCXConduit::open() {
     _lastSyncDate = _world.preferences.get(kDaemonDomain, kLastSyncDateKey).date().value_or(Date::distantPast());
     _scan.reset();
+    _publishers.clear();
 }
 
 void CXDCXConduit::close() {

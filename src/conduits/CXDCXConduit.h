@@ -7,6 +7,7 @@
 #include <optional>
 #include <string>
 #include <unistd.h>
+#include <unordered_map>
 #include <vector>
 
 namespace rolvane {
@@ -21,6 +22,8 @@ class Clock;
 class Preferences;
 
 // The conduit of the owner's contact database: turns what happens there into change records. Main thread only.
+//
+// Records of other sources are applied in CXDCXConduitApplying.cpp.
 //
 // What it never does is see the daemon's own writes as somebody's edits: it hears only of other processes' saves, drops
 // a notification whose sender is this process, and compares against a prior state that the engine keeps up to date as
@@ -47,9 +50,30 @@ public:
 
     std::optional<std::string> conduitID() const override;
     int32_t conduitSource() const override;
-    // Applies no record of any type yet: false, and the record stays with the engine.
+    // Writes one record from another source into the database, through the handler of its type. False for composite
+    // group changes, distribution-list removals and unknown types, which nothing here carries out; true for every other
+    // record, what it names being gone included. Never denies. While the kill switch is on, a record of the owner's own
+    // user is logged and swallowed. But for new groups, nothing is saved before the pass ends.
     using CXDConduit::applyChangeRecord;
     bool applyChangeRecord(const CXDChangeRecordPtr& record, bool* denied) override;
+
+    // The handlers, each true on every path. Identifiers come in either form, shared or subscribed. They change only
+    // what belongs to the record's user: another user's record never reaches the owner's own people and groups, nor the
+    // copies of a third user. Kinds are checked too: what a member list calls a person and is none stays as it is.
+    bool updateRecord(const CXDChangeRecordPtr& record);
+    bool createStructureForGroup(const CXDChangeRecordPtr& record); // saves
+    bool changeGroupName(const CXDChangeRecordPtr& record);
+    bool addRecordToGroup(const CXDChangeRecordPtr& record);
+    bool addGroupToGroup(const CXDChangeRecordPtr& record);
+    bool removeRecordFromGroup(const CXDChangeRecordPtr& record);
+    bool removeGroupFromGroup(const CXDChangeRecordPtr& record);
+    bool deleteRecord(const CXDChangeRecordPtr& record);
+    bool deleteGroup(const CXDChangeRecordPtr& record); // the all-contacts group too; the database refuses that
+    bool changeGroupReadACL(const CXDChangeRecordPtr& record);
+    bool changeGroupReadWriteACL(const CXDChangeRecordPtr& record); // the manager's `save` writes it
+    bool updateDistributionList(const CXDChangeRecordPtr& record);
+    // The manager that the base finds, else a new one, kept under the URL's own text.
+    std::shared_ptr<CXACLManager> ACLManagerForRemoteLocation(const Url& location) override;
 
     void open() override;
     // Saves the database, forgets revoked users, moves the last-sync date to now and, after a full scan, the journal's
@@ -93,6 +117,11 @@ private:
     };
 
     Dictionary priorState() const;
+    // What the record names, where it is there, of the right kind and the record's to change; else null.
+    std::shared_ptr<CXPerson> personOf(const CXDChangeRecord& record);
+    std::shared_ptr<CXGroup> groupOf(const CXDChangeRecord& record);
+    std::shared_ptr<CXGroup> subgroupOf(const CXDChangeRecord& record);
+    bool mayChange(const CXDChangeRecord& record, const CXRecord& found);
     void captureInserted(ChangeCapture& capture, const Array& identifiers);
     void captureUpdated(ChangeCapture& capture, const Array& identifiers);
     void captureDeleted(ChangeCapture& capture, const Array& identifiers);
@@ -100,6 +129,7 @@ private:
     World _world;
     bool _readOnlyKillSwitch = false;
     std::optional<Scan> _scan;
+    std::unordered_map<RemoteLocation, UserName> _publishers; // whose the locations are, as far as asked
     ObservationHandle _databaseChanged;
 };
 

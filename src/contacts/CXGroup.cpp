@@ -142,6 +142,14 @@ bool CXGroup::addSubgroup(const CXGroupRef& group) {
     return database.impl().list(uniqueId(), group->uniqueId());
 }
 
+bool CXGroup::mayListSubgroup(const CXGroupRef& group) const {
+    CXRolvane* database = rolvane();
+    if (!database || !group || group->rolvane() != database || group->isAllGroup()) return false;
+    std::lock_guard lock(database->impl().mutex);
+    std::set<UniqueId> seen;
+    return isAttached() && group->isAttached() && !holds(database->impl(), group->uniqueId(), uniqueId(), seen);
+}
+
 bool CXGroup::removeSubgroup(const CXGroupRef& group) {
     CXRolvane& database = databaseOfBoth(*this, group);
     std::lock_guard lock(database.impl().mutex);

@@ -41,6 +41,8 @@ public:
     virtual bool removeMember(const CXPersonRef& person); // takes the person's distribution choices along
     // Throws kCXInvalidArgumentException, naming both groups, when it would make the group contain itself.
     virtual bool addSubgroup(const CXGroupRef& group);
+    // Would addSubgroup not throw? False for an all-contacts group and for what this group is, or is below of.
+    bool mayListSubgroup(const CXGroupRef& group) const;
     virtual bool removeSubgroup(const CXGroupRef& group);
     std::vector<CXGroupRef> parentGroups() const; // the groups that list this one
 

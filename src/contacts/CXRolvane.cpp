@@ -105,6 +105,8 @@ void CXRolvane::addRecord(const CXRecordRef& record) {
     Dictionary properties = record->_detached;
     if (there == RecordKind::none)
         _impl->insert(record->uniqueId(), fresh, properties);
+    else if (isPlainGroup(fresh))
+        for (const auto& [name, value] : properties) _impl->setProperty(record->uniqueId(), name, value);
     else
         _impl->replaceProperties(record->uniqueId(), properties);
     _impl->adopt(record);

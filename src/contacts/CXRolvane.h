@@ -85,9 +85,10 @@ public:
     // In order of modification date (unsaved ones last). All-contacts groups are never among them.
     std::vector<CXRecordRef> recordsMatchingSearchElement(const CXSearchElement& element);
 
-    // Adds a record that belongs to no database. When a record of that identifier is here already, its properties are
-    // replaced (a group keeps its members) and the handle becomes one on it. A subscription to a location that is
-    // subscribed already is refused with kCXInvalidArgumentException. A handle that is here already: nothing.
+    // Adds a record that belongs to no database. When a record of that identifier is here already, the handle becomes
+    // one on it: a person's properties are replaced; a group keeps its members and what the new one says nothing of. A
+    // subscription to a location that is subscribed already is refused with kCXInvalidArgumentException. A handle that
+    // is here already: nothing.
     void addRecord(const CXRecordRef& record);
     // Removes the record with its memberships and distribution choices. Removing a subscription removes its location's
     // people, groups and all-contacts group in the same save. Refused with a log line and no effect: all-contacts

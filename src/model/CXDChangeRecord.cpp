@@ -138,6 +138,7 @@ Value CXDChangeRecord::payload() {
     const std::optional<Dictionary> fetched = _fileManager->dictionaryAtURL(*_delayedPayloadURL, &ignored, true);
     const Value held = inMemoryPayload();
     if (!fetched) return held;
+    _delayedPayloadWasRead = true;
     Dictionary merged = fetched->mutableCopy();
     if (const Dictionary* over = held.dictionaryIf()) merged.addEntriesFrom(*over);
     setPayload(merged);

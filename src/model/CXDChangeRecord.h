@@ -85,6 +85,8 @@ public:
     // Reads the delayed payload afresh at every call and lays the in-memory entries over it; a failed read gives the
     // in-memory payload. Without a delayed payload: the in-memory one, absent when there is none.
     Value payload();
+    // Has a call of payload() read the delayed payload? What is in memory alone may be no more than a stamp.
+    bool delayedPayloadWasRead() const { return _delayedPayloadWasRead; }
     Value inMemoryPayload() const; // never reads the URL
     // The payload's bytes while it has no delayed part and nobody has looked inside; null otherwise. Whoever needs the
     // content once decodes a tree of its own from them, and none stays in the record.
@@ -127,6 +129,7 @@ private:
     std::shared_ptr<Payload> _payload;
     std::optional<Url> _delayedPayloadURL;
     CXFileManager* _fileManager = nullptr;
+    bool _delayedPayloadWasRead = false;
 };
 
 } // namespace rolvane

@@ -27,12 +27,6 @@ TEST_F(Capture, IsTheConduitOfTheContactDatabase) {
     EXPECT_EQ(&conduit->rolvane(), &database);
 }
 
-TEST_F(Capture, AppliesNoRecordOfAnyType) {
-    for (int type : {1, 2, 3, 4, 5, 6, 7, 8, 9, 257, 258, 259, 260, 261})
-        EXPECT_FALSE(conduit->applyChangeRecord(std::make_shared<CXDChangeRecord>(
-            CXDSyncSourceVaultra, type, UserName("bob"), std::nullopt, std::nullopt)));
-}
-
 TEST_F(Capture, TheKillSwitchIsOnUnlessSomebodyMayWriteTheOwnersData) {
     EXPECT_TRUE(conduit->readOnlyKillSwitch()) << "no list at all";
     database.allGroup()->setValue(CXMultiValue(), kCXReadWriteSharingACLProperty);

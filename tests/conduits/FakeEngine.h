@@ -60,7 +60,10 @@ public:
         const auto found = sources.find(group);
         return found == sources.end() ? 0 : found->second;
     }
-    CXDConduit* conduitForSyncSource(int32_t) override { return nullptr; }
+    CXDConduit* conduitForSyncSource(int32_t source) override {
+        const auto found = conduits.find(source);
+        return found == conduits.end() ? nullptr : found->second;
+    }
 
     void updateStateAndExitIfNeeded() override { note("updateStateAndExitIfNeeded"); }
     void checkCXShareCount() override { note("checkCXShareCount"); }
@@ -83,6 +86,7 @@ public:
     std::map<UniqueId, RemoteLocation> subscriptionMap;
     std::optional<UserName> canceledUser;
     std::map<UniqueId, int32_t> sources;
+    std::map<int32_t, CXDConduit*> conduits; // by source; none unless a test says so
     CXDChangeRecords applied;
     std::atomic<bool> locks = true;
 
