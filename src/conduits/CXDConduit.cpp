@@ -53,15 +53,6 @@ CXDChangeRecords CXDConduit::changeRecords() {
     return comparePriorStateToCurrentState(prior, currentState());
 }
 
-Dictionary CXDConduit::currentState() {
-    return {};
-}
-
-CXDChangeRecords CXDConduit::comparePriorStateToCurrentState(const Dictionary& /*prior*/,
-                                                             const Dictionary& /*current*/) {
-    return {};
-}
-
 bool CXDConduit::applyChangeRecordIfNeeded(const CXDChangeRecordPtr& record, bool* denied) {
     // The record's user itself, not its real user: that is how the location of a revoked subscription is written.
     const auto base = baseLocationForUser(record->user());

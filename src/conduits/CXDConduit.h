@@ -7,10 +7,13 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <vector>
 
 namespace rolvane {
 
 class CXFileManager;
+class CXRolvane;
+class Preferences;
 
 // One sync source. The engine creates it, opens it, asks it for change records, hands it the records that are addressed
 // to it and closes it. No lock of its own: the engine keeps a conduit to one thread, but for applyChangeRecordIfNeeded
@@ -38,9 +41,32 @@ public:
     virtual void close();
     // Base: the comparison of prior and current state of a store.
     virtual CXDChangeRecords changeRecords();
-    // The base finds nothing changed; store conduits that read their store override these two.
+
+    // What the store holds now of everybody that concerns this database: the owner's own publication, when something is
+    // known of it, and every subscription that this source serves. New containers. A store that could not be read has
+    // no entry. A subscription that the store forbids is revoked here.
     virtual Dictionary currentState();
+    // Records for the contact database, in order (see StoreComparison.h for the states). Writes the current serial
+    // numbers into the prior state. A store that was replaced is cancelled and gives no records.
     virtual CXDChangeRecords comparePriorStateToCurrentState(const Dictionary& prior, const Dictionary& current);
+    Dictionary compareGroupPriorStateTo(const Value& prior, const Value& current) const;
+    Dictionary comparePriorDistributionListToCurrentDistributionList(const Value& prior, const Value& current) const;
+
+    // One user's store as a per-user state; nothing when it could not be read whole. `forbidden` (may be null): set
+    // when the store says that there is nothing (404) or nothing for us (403), else cleared.
+    std::optional<Dictionary> fetchWorkingStateForSubscription(const Url& base, bool* forbidden);
+    // None, one or two records: what the store's access lists and the contact database's memory of them differ by.
+    CXDChangeRecords changeRecordsForACLAtRemoteLocation(const Url& location);
+    // {"deletions", "additions"}; an absent array counts as empty.
+    static Dictionary compareCurrentACLWithPriorACL(const Value& current, const Value& prior);
+
+    // Ends the owner's publication in the contact database; the location's user is forgotten.
+    void cancelPublishing(const RemoteLocation& location);
+    // Ends a subscription (or the owner's publication) here: forgets the user and cleans up.
+    void cancelSharingTo(const RemoteLocation& location);
+    // Takes away what came from the location, in one save. The owner's own: the marks of the publication only. Another
+    // user's: the copies and the subscription.
+    void removeRecordsAssociateWithRemoteLocation(const RemoteLocation& location);
 
     // True: this source is done with the record (applied, cancelled, or of a revoked location). An exception of the
     // base class costs one false and two log lines.
@@ -59,10 +85,26 @@ public:
     void unstamp(Dictionary& dictionary) const;
 
 protected:
+    // What a store conduit touches beside its store. Base: the process's own; borrowed.
+    virtual CXRolvane& database() const;
+    virtual Preferences& preferences() const;
+    // Whether access lists are kept at the source, so that somebody else may have changed them. Base: yes.
+    virtual bool keepsAccessLists() const { return true; }
+
     std::optional<Date> _lastSyncDate;
     ConduitEngine& _engine;
     // Base-location text to manager; made on first use.
     std::optional<std::map<std::string, std::shared_ptr<CXACLManager>>> _ACLManagerMap;
+
+private:
+    std::vector<RemoteLocation> locationsToRead(); // the owner's first; also tells the engine of the subscriptions
+    void readLocation(const RemoteLocation& location, Dictionary& state);
+    bool readGroup(const Url& base, const std::string& name, Dictionary& groupState);
+    CXDChangeRecordPtr contactUpdate(const UserName& user, const RemoteLocation& base, const UniqueId& contact) const;
+    void compareUser(const UserName& user, const Dictionary& priorState, const Dictionary& current,
+                     CXDChangeRecords& records);
+    void appendACLChange(CXDChangeType type, const UserName& user, const std::vector<UserName>& current,
+                         const Value& prior, CXDChangeRecords& records) const;
 };
 
 } // namespace rolvane

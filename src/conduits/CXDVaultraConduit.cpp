@@ -166,6 +166,10 @@ void CXDVaultraConduit::warnUserAboutUserNameOrPassword() {
     _world.preferences.synchronize(kDaemonDomain);
 }
 
+Dictionary CXDVaultraConduit::currentState() {
+    return CXDConduit::currentState();
+}
+
 // -- applying
 
 bool CXDVaultraConduit::lockStructureForRecord(const CXDChangeRecord& record) {

@@ -14,6 +14,7 @@ namespace rolvane {
 
 class CXDAVManager;
 class CXNetworkController;
+class CXRolvane;
 class Clock;
 class Preferences;
 class UserAlert;
@@ -46,7 +47,9 @@ public:
         NotificationCenter& notifications;     // this process's: the network's changes
         DistributedNotifications& distributed; // the user's processes': "SimulateVaultraNotification"
         UserAlert& alert;
+        CXRolvane& rolvane;
         ACLManagerFactory makeACLManager = makePlainACLManager;
+        bool storeKeepsAccessLists = false; // false: nobody else can have changed what the managers say
     };
 
     CXDVaultraConduit(ConduitEngine& engine, World world);
@@ -70,6 +73,9 @@ public:
     // location has no base location.
     std::shared_ptr<CXACLManager> ACLManagerForRemoteLocation(const Url& location) override;
 
+    // As the base's, with every group file that has not changed since it was read last taken from the client's memory.
+    Dictionary currentState() override;
+
     bool vaultraOffLine() const { return _vaultraOffLine; }
     // Touches the owner's clock file and asks for its date; nothing when the store does not answer.
     std::optional<Date> currentServerDate();
@@ -80,6 +86,11 @@ public:
     void vaultraSynced();
     bool shouldWarnUserAboutUserNameOrPassword() const;
     void warnUserAboutUserNameOrPassword();
+
+protected:
+    CXRolvane& database() const override { return _world.rolvane; }
+    Preferences& preferences() const override { return _world.preferences; }
+    bool keepsAccessLists() const override { return _world.storeKeepsAccessLists; }
 
 private:
     int testReachability(); // sets _vaultraOffLine; the error's code, 0 when there was none

@@ -2,7 +2,10 @@
 
 #include "acl/CXACLManager.h"
 #include "contacts/Constants.h"
+#include "foundation/Utf8.h"
 #include "model/PayloadKeys.h"
+
+#include <algorithm>
 
 namespace rolvane::layout {
 namespace {
@@ -48,6 +51,12 @@ bool isASpecialFile(std::string_view name) {
 
 bool isARecordsName(const UniqueId& uid) {
     return !uid.empty() && !isASpecialFile(uid.str()) && uid.str() != kPeople && uid.str().front() != '.';
+}
+
+bool isASoundName(std::string_view name) {
+    constexpr size_t kLongest = 255;
+    if (name.empty() || name.size() > kLongest || name.front() == '.' || !isUtf8(name)) return false;
+    return std::none_of(name.begin(), name.end(), [](unsigned char c) { return c < 0x20 || c == 0x7f || c == '/'; });
 }
 
 Dictionary groupStateAfterComposite(const Dictionary& state, const Dictionary& payload) {

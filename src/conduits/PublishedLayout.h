@@ -39,6 +39,10 @@ bool isASpecialFile(std::string_view name);
 // Whether a group or person may be called so in a tree: no name of the tree's own files and folders.
 bool isARecordsName(const UniqueId& uid);
 
+// Whether a name in a listing can be a record's: valid UTF-8 of at most 255 bytes without control characters or
+// slashes, not the name of a hidden file.
+bool isASoundName(std::string_view name);
+
 // The group state after a composite change; `state` and `payload` stay as they are. Additions come before removals, a
 // member is listed once however often it is added, a removal takes out every occurrence, and the three containers
 // exist afterwards. A part of either that is of another kind than expected counts as empty.

@@ -3,6 +3,7 @@
 #include "../store/StoreWorld.h"
 #include "FakeEngine.h"
 #include "conduits/UserAlert.h"
+#include "contacts/CXRolvane.h"
 #include "contacts/Constants.h"
 #include "foundation/Preferences.h"
 #include "foundation/PropertyList.h"
@@ -57,7 +58,8 @@ protected:
     void use(std::unique_ptr<Client> other) {
         conduit.reset();
         client = std::move(other);
-        CXDVaultraConduit::World parts{client->manager, network, preferences, clock, center, distributed, alert};
+        CXDVaultraConduit::World parts{client->manager, network,     preferences, clock,
+                                       center,          distributed, alert,       database};
         parts.makeACLManager = [this](const Url& base, const LocationOwner& owner) {
             auto manager = makePlainACLManager(base, owner);
             managers.push_back(manager);
@@ -102,6 +104,7 @@ protected:
     NotificationCenter center;
     LocalNotifications distributed;
     Preferences preferences{directory / "preferences.db"};
+    CXRolvane database{CXRolvane::Options{.path = directory / "contacts.db", .program = "RolvaneManager"}};
     CapturingLog log;
     std::vector<std::shared_ptr<CXACLManager>> managers;
     std::unique_ptr<Client> client;
@@ -465,8 +468,8 @@ TEST_F(VaultraConduit, ContactsAndStatesAreWrittenSecurelyMarkersNamesAndTheCloc
         return answerOf(request.method == "GET" ? 404 : 201);
     });
     CXDAVManager manager(account, wire);
-    CXDVaultraConduit plain(engine,
-                            CXDVaultraConduit::World{manager, network, preferences, clock, center, distributed, alert});
+    CXDVaultraConduit plain(
+        engine, CXDVaultraConduit::World{manager, network, preferences, clock, center, distributed, alert, database});
     const auto requestsOf = [&](const CXDChangeRecordPtr& change) {
         asked.clear();
         EXPECT_TRUE(plain.applyChangeRecord(change));

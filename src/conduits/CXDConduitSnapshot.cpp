@@ -1,0 +1,241 @@
+// The half of the conduit base that looks at a store: what it holds now, and what that changes.
+
+#include "conduits/CXDConduit.h"
+#include "conduits/PublishedLayout.h"
+#include "conduits/StoreComparison.h"
+#include "contacts/CXRolvane.h"
+#include "contacts/Constants.h"
+#include "contacts/Identifier.h"
+#include "foundation/Log.h"
+#include "foundation/Preferences.h"
+#include "model/PayloadKeys.h"
+#include "model/RemoteLocationMap.h"
+#include "store/CXFileManager.h"
+
+#include <algorithm>
+
+namespace rolvane {
+namespace {
+
+constexpr int kForbidden = 403;
+constexpr int kNotFound = 404;
+constexpr std::string_view kGroupSuffix = "CXGroup";
+constexpr std::string_view kPersonSuffix = "CXPerson";
+
+// Fit for a log: a hostile name may be long and hold anything.
+std::string shown(const std::string& name) {
+    constexpr size_t kShown = 80;
+    return Url::percentEncodeComponent(std::string_view(name).substr(0, kShown));
+}
+
+std::string nameOf(const std::string& path, const FileInfo& info) {
+    if (!info.displayName.empty()) return info.displayName;
+    const std::string_view text = std::string_view(path).substr(0, path.find_last_not_of('/') + 1);
+    return std::string(text.substr(text.rfind('/') + 1));
+}
+
+Array arrayOf(const std::vector<UserName>& principals) {
+    Array all;
+    for (const UserName& principal : principals) all.append(principal);
+    return all;
+}
+
+} // namespace
+
+// -- the snapshot
+
+std::vector<RemoteLocation> CXDConduit::locationsToRead() {
+    std::vector<RemoteLocation> locations;
+    const Dictionary prior = _engine.conduitObjectForKey(*conduitID(), kPriorState);
+    if (prior.contains(kSelf.str()))
+        if (const auto own = baseLocationForUser(realUserFromUser(kSelf)))
+            locations.emplace_back(own->absoluteString());
+    preferences().synchronize(kApplicationDomain);
+    for (const CXSubscriptionRef& subscription : database().subscriptions()) {
+        const RemoteLocation location = subscription->remoteLocation();
+        if (syncSourceForRemoteLocation(location) != conduitSource()) continue;
+        locations.push_back(location);
+        _engine.setRemoteLocationForSubscriptionUID(location, subscription->uniqueId());
+    }
+    return locations;
+}
+
+Dictionary CXDConduit::currentState() {
+    Dictionary state;
+    if (!conduitID() || conduitSource() == 0) return state; // no source of its own
+    for (const RemoteLocation& location : locationsToRead()) readLocation(location, state);
+    return state;
+}
+
+void CXDConduit::readLocation(const RemoteLocation& location, Dictionary& state) {
+    const UserName user = _engine.userForRemoteLocation(location);
+    if (user.empty() || state.contains(user.str())) return; // a location that names nobody cannot be read
+    const auto base = baseLocationForUser(realUserFromUser(user));
+    if (!base) return;
+    bool forbidden = true;
+    const auto userState = fetchWorkingStateForSubscription(*base, &forbidden);
+    if (forbidden) {
+        const CXSubscriptionRef subscription = database().findSubscriptionWithRemoteLocation(location);
+        _engine.revokeRemoteLocation(location, subscription ? std::optional(subscription->uniqueId()) : std::nullopt);
+        removeRecordsAssociateWithRemoteLocation(location);
+    }
+    if (!userState) return;
+    if (!userState->contains(layout::kAllGroup)) {
+        Array everybody;
+        for (const auto& [contact, info] : (*userState)[kPeopleState].dictionary()[kMemberUIDState].dictionary())
+            everybody.append(contact);
+        Dictionary(*userState).set(layout::kAllGroup, Dictionary{{kMemberUIDState, everybody}});
+    }
+    state.set(user.str(), *userState);
+}
+
+std::optional<Dictionary> CXDConduit::fetchWorkingStateForSubscription(const Url& base, bool* forbidden) {
+    CXFileManager* manager = defaultManager();
+    if (!manager) return std::nullopt;
+    Dictionary state, people;
+    state.dictionaryFor(kPeopleState).set(kMemberUIDState, people);
+    int code = 0;
+    const auto info = manager->dictionaryAtURL(base.cxURLByAppendingComponent(layout::kInfo), &code, false);
+    if (forbidden) {
+        *forbidden = code == kNotFound || code == kForbidden;
+        if (*forbidden) return std::nullopt;
+    }
+    if (info)
+        if (const Value serial = (*info)[kSerialNumber]) state.set(kSerialNumber, serial);
+
+    const auto listing = manager->infoForFilesInContainer(base);
+    if (!listing) {
+        CXLog("Could not retrieve info for files in subscription: %@", base);
+        return std::nullopt;
+    }
+    for (const auto& [path, file] : *listing) {
+        const std::string name = nameOf(path, file);
+        if (isASpecialFile(name) || name == layout::kPeople) continue;
+        const bool isGroup = name.ends_with(kGroupSuffix);
+        if (!isGroup && !name.ends_with(kPersonSuffix)) continue;
+        if (!layout::isASoundName(name)) {
+            CXLog("An entry with a strange name in %@ is left out: %@", base, shown(name));
+        } else if (isGroup) {
+            Dictionary groupState;
+            if (file.modificationdate) {
+                groupState.set(kModificationDate, *file.modificationdate);
+                if (!readGroup(base, name, groupState)) return std::nullopt;
+            }
+            state.set(name, groupState);
+        } else if (file.modificationdate) {
+            people.set(name, Dictionary{{kModificationDate, *file.modificationdate}});
+        }
+    }
+    return state;
+}
+
+bool CXDConduit::readGroup(const Url& base, const std::string& name, Dictionary& groupState) {
+    const Url location = base.cxURLByAppendingComponent(name);
+    int code = 0;
+    const auto content = defaultManager()->dictionaryAtURL(location, &code, false);
+    if (content)
+        groupState.addEntriesFrom(*content);
+    else
+        CXLog("Could not get group info at: %@, error: %d", location, code);
+    return content.has_value();
+}
+
+// -- the comparison
+
+CXDChangeRecords CXDConduit::comparePriorStateToCurrentState(const Dictionary& prior, const Dictionary& current) {
+    CXDChangeRecords records;
+    for (const auto& [user, state] : prior) compareUser(UserName(user), prior, current, records);
+    for (const auto& [user, state] : current)
+        if (!prior.contains(user)) compareUser(UserName(user), prior, current, records);
+    return records;
+}
+
+void CXDConduit::compareUser(const UserName& user, const Dictionary& prior, const Dictionary& current,
+                             CXDChangeRecords& records) {
+    const Dictionary now = current[user.str()].dictionary();
+    const Value serial = now[kSerialNumber];
+    const auto base = baseLocationForUser(user); // of the user as it stands, "<self>" included
+    if (!serial.isString() || !base) return;     // could not be read, or is no store of ours
+    const RemoteLocation baseText(base->absoluteString());
+    const Dictionary* known = prior[user.str()].dictionaryIf();
+    Dictionary before = known ? *known : Dictionary();
+    const Value knownSerial = before[kSerialNumber];
+    if (knownSerial.isString() && knownSerial.string() != serial.string()) {
+        cancelSharingTo(baseText);
+        return;
+    }
+    before.set(kSerialNumber, serial);
+
+    const CXDChangeRecords lists = changeRecordsForACLAtRemoteLocation(*base);
+    records.insert(records.end(), lists.begin(), lists.end());
+
+    StoreUser who{user, baseText, conduitSource(), known == nullptr, _lastSyncDate, {}, {}};
+    who.mayWrite = [&] {
+        const auto manager = ACLManagerForRemoteLocation(*base);
+        if (!manager) return false;
+        const std::vector<UserName>& writers = manager->principalsWithAllAccess();
+        return std::find(writers.begin(), writers.end(), kSelf) != writers.end();
+    };
+    who.contactUpdate = [&](const UniqueId& contact) { return contactUpdate(user, baseText, contact); };
+    const CXDChangeRecords changes = compareStoreStates(before, now, who);
+    records.insert(records.end(), changes.begin(), changes.end());
+}
+
+CXDChangeRecordPtr CXDConduit::contactUpdate(const UserName& user, const RemoteLocation& base,
+                                             const UniqueId& contact) const {
+    Dictionary payload;
+    UniqueId person = contact;
+    if (user == kSelf) {
+        unstamp(payload);
+    } else {
+        person = cxUIDWithTableName(contact, kCXSubscribedPersonTable);
+        stampWithRemoteLocation(payload, base);
+    }
+    auto record = std::make_shared<CXDChangeRecord>(conduitSource(), CXDUpdateRecord, user, person, std::nullopt,
+                                                    std::move(payload));
+    record->packPayload(); // there may be very many, and few are looked into at a time
+    record->setAppliesToSources(CXDSyncSourceCX);
+    if (const auto location = locationForUID(contact, user)) record->setDelayedPayloadURL(*location, defaultManager());
+    return record;
+}
+
+Dictionary CXDConduit::compareGroupPriorStateTo(const Value& prior, const Value& current) const {
+    return groupDifference(prior, current);
+}
+
+Dictionary CXDConduit::comparePriorDistributionListToCurrentDistributionList(const Value& prior,
+                                                                             const Value& current) const {
+    return distributionListDifference(prior, current);
+}
+
+// -- access lists
+
+CXDChangeRecords CXDConduit::changeRecordsForACLAtRemoteLocation(const Url& location) {
+    CXDChangeRecords records;
+    const auto manager = keepsAccessLists() ? ACLManagerForRemoteLocation(location) : nullptr;
+    if (!manager) return records;
+    const UserName user = _engine.userForRemoteLocation(RemoteLocation(location.absoluteString()));
+    const Dictionary users = _engine.conduitObjectForKey(kConduitCX, kPriorState);
+    const Dictionary prior = users[user.str()].dictionary()[layout::kAllGroup].dictionary();
+    appendACLChange(CXDChangeGroupReadWriteACL, user, manager->principalsWithAllAccess(),
+                    prior[kCXReadWriteSharingACLProperty], records);
+    appendACLChange(CXDChangeGroupReadACL, user, manager->principalsWithReadAccess(), prior[kCXReadSharingACLProperty],
+                    records);
+    return records;
+}
+
+void CXDConduit::appendACLChange(CXDChangeType type, const UserName& user, const std::vector<UserName>& current,
+                                 const Value& prior, CXDChangeRecords& records) const {
+    const Dictionary difference = compareCurrentACLWithPriorACL(arrayOf(current), prior);
+    if (difference[kAdditions].array().empty() && difference[kDeletions].array().empty()) return;
+    auto record = std::make_shared<CXDChangeRecord>(conduitSource(), type, user, std::nullopt,
+                                                    UniqueId(layout::kAllGroup), difference);
+    record->setAppliesToSources(CXDSyncSourceCX);
+    records.push_back(std::move(record));
+}
+
+Dictionary CXDConduit::compareCurrentACLWithPriorACL(const Value& current, const Value& prior) {
+    return cxDifferencesBetweenArray(prior.array(), current.array());
+}
+
+} // namespace rolvane
