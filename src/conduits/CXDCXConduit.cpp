@@ -29,7 +29,7 @@ CXSearchElement groupsModifiedAfter(Date date) {
 
 } // namespace
 
-CXDCXConduit::CXDCXConduit(ConduitEngine& engine, World world) : CXDConduit(engine), _world(world) {
+CXDCXConduit::CXDCXConduit(ConduitEngine& engine, World world) : CXDConduit(engine), _world(std::move(world)) {
     setKillSwitch();
     _databaseChanged =
         _world.notifications.observe(kCXDatabaseChangedExternallyNotificationPriv,
@@ -55,6 +55,14 @@ Dictionary CXDCXConduit::priorState() const {
     return engine().conduitObjectForKey(kConduitCX, kPriorState);
 }
 
+const std::string& CXDCXConduit::ownProgram() const {
+    return _world.program.empty() ? rolvane().programName() : _world.program;
+}
+
+ChangeCapture CXDCXConduit::newCapture() const {
+    return {engine(), rolvane(), priorState(), ownProgram()};
+}
+
 // -- a pass
 
 void CXDCXConduit::open() {
@@ -78,15 +86,16 @@ CXDChangeRecords CXDCXConduit::changeRecords() {
     const Date since = _lastSyncDate.value_or(Date::distantPast());
     const Scan scan{rolvane().journalPosition(), since};
 
-    ChangeCapture capture(engine(), rolvane(), priorState());
+    ChangeCapture capture = newCapture();
     capture.reader().expectMany();
     for (const CXSearchElement& modified :
          {groupsModifiedAfter<CXGroup>(since), groupsModifiedAfter<CXSubscribedGroup>(since)})
         for (const CXRecordRef& group : rolvane().recordsMatchingSearchElement(modified))
             capture.addGroup(std::dynamic_pointer_cast<CXGroup>(group));
     for (const std::string_view table : {kCXPersonTable, kCXSubscribedPersonTable})
-        rolvane().forEachPersonModifiedSince(since, table,
-                                             [&](const CXRow& person) { capture.addPerson(person, true); });
+        rolvane().forEachPersonModifiedSince(since, table, [&](const CXRow& person) {
+            if (person.writer != ownProgram()) capture.addPerson(person, true);
+        });
     for (const CXSubscriptionRef& subscription : rolvane().subscriptions())
         if (subscription->_isAll())
             capture.addGroup(rolvane().allGroupForRemoteLocation(subscription->remoteLocation()));
@@ -105,7 +114,7 @@ void CXDCXConduit::rolvaneChanged(const Notification& notification) {
 
     const Array inserted = notification.userInfo[kCXInsertedRecords].array();
     const Array updated = notification.userInfo[kCXUpdatedRecords].array();
-    ChangeCapture capture(engine(), rolvane(), priorState());
+    ChangeCapture capture = newCapture();
     if (inserted.count() + updated.count() >= kMany) capture.reader().expectMany();
     captureInserted(capture, inserted);
     captureUpdated(capture, updated);
@@ -172,13 +181,13 @@ void CXDCXConduit::lookForRevokedSubscriptions(const std::vector<UniqueId>& dele
 // -- single generators
 
 CXDChangeRecords CXDCXConduit::changesForPerson(const std::shared_ptr<CXPerson>& person, bool update) {
-    ChangeCapture capture(engine(), rolvane(), priorState());
+    ChangeCapture capture = newCapture();
     if (person) capture.addPerson(rolvane().personRow(person->uniqueId()), update);
     return capture.take();
 }
 
 CXDChangeRecords CXDCXConduit::changesForGroup(const std::shared_ptr<CXGroup>& group) {
-    ChangeCapture capture(engine(), rolvane(), priorState());
+    ChangeCapture capture = newCapture();
     capture.addGroup(group);
     return capture.take();
 }
@@ -186,7 +195,7 @@ CXDChangeRecords CXDCXConduit::changesForGroup(const std::shared_ptr<CXGroup>& g
 CXDChangeRecords CXDCXConduit::compareGroupPriorStateToCurrentState(const Value& prior, const Value& current,
                                                                     const UniqueId& guid,
                                                                     const RemoteLocation& location) {
-    ChangeCapture capture(engine(), rolvane(), priorState());
+    ChangeCapture capture = newCapture();
     capture.addComparison(prior, current, guid, location, nullptr);
     return capture.take();
 }
@@ -203,7 +212,7 @@ Dictionary CXDCXConduit::currentDistributionListStateForGroup(const std::shared_
 
 CXDChangeRecords CXDCXConduit::distributionListChangesForPerson(const std::shared_ptr<CXPerson>& person,
                                                                 int32_t sources, const UserName& user) {
-    ChangeCapture capture(engine(), rolvane(), priorState());
+    ChangeCapture capture = newCapture();
     if (const auto row = rolvane().personRow(person->uniqueId())) capture.addDistributionLists(*row, sources, user);
     return capture.take();
 }

@@ -43,6 +43,7 @@ public:
         Clock& clock;
         NotificationCenter& notifications; // this process's: the framework posts other processes' saves here
         pid_t processID = getpid();        // whose saves are this daemon's own
+        std::string program{};             // the same for earlier runs; "": the database's program name
     };
 
     CXDCXConduit(ConduitEngine& engine, World world);
@@ -80,6 +81,8 @@ public:
     // cursor behind what the scan captured.
     void close() override;
     // The full scan: groups and people modified after the last sync, then every all-contacts group whatever the dates.
+    // People whom the daemon itself wrote last are left out: a pass that was cut off before it could move the last-sync
+    // date has their data from a store, where something newer may stand by now.
     CXDChangeRecords changeRecords() override;
 
     // Another process has saved. Hands the records to the engine in one trickle pass.
@@ -117,6 +120,8 @@ private:
     };
 
     Dictionary priorState() const;
+    ChangeCapture newCapture() const;
+    const std::string& ownProgram() const;
     // What the record names, where it is there, of the right kind and the record's to change; else null.
     std::shared_ptr<CXPerson> personOf(const CXDChangeRecord& record);
     std::shared_ptr<CXGroup> groupOf(const CXDChangeRecord& record);

@@ -24,8 +24,8 @@ UniqueId sharedGroup(const UniqueId& uid) {
 
 } // namespace
 
-ChangeCapture::ChangeCapture(ConduitEngine& engine, CXRolvane& rolvane, Dictionary priorState)
-    : _engine(engine), _reader(rolvane), _priorState(std::move(priorState)) {}
+ChangeCapture::ChangeCapture(ConduitEngine& engine, CXRolvane& rolvane, Dictionary priorState, std::string ownProgram)
+    : _engine(engine), _reader(rolvane), _priorState(std::move(priorState)), _ownProgram(std::move(ownProgram)) {}
 
 void ChangeCapture::add(CXDChangeRecords records) {
     std::move(records.begin(), records.end(), std::back_inserter(_records));
@@ -132,6 +132,7 @@ std::optional<UniqueId> ChangeCapture::allGroupAt(const RemoteLocation& location
 
 void ChangeCapture::addMember(const UniqueId& member) {
     if (const auto known = _reader.knownPersonFor(member)) {
+        if (_arrived.contains(*known)) return;
         const auto found = _people.find(*known);
         if (found != _people.end()) {
             for (const Captured& at : found->second)
@@ -139,7 +140,12 @@ void ChangeCapture::addMember(const UniqueId& member) {
             return;
         }
     }
-    addPerson(_reader.personForUniqueId(member), true);
+    const auto person = _reader.personForUniqueId(member);
+    if (person && !cameFromPublisher(*person)) addPerson(*person, true);
+}
+
+bool ChangeCapture::cameFromPublisher(const CXRow& person) const {
+    return !_ownProgram.empty() && person.writer == _ownProgram && cxIsSubscribed(person.uniqueId);
 }
 
 // Many new members: the data of those that are not captured yet is read together, so that announcing them finds it
@@ -155,7 +161,12 @@ void ChangeCapture::readNewMembers(const GroupSteps& steps, const CXGroup& group
     });
     if (wanted.size() < kFew || wanted.size() * kRowsPerLookup < group.memberCount()) return;
     _reader.expectMany();
-    _reader.forEachMember(group, wanted, [this](const CXRow& row) { captured(row); });
+    _reader.forEachMember(group, wanted, [this](const CXRow& row) {
+        if (cameFromPublisher(row))
+            _arrived.insert(row.uniqueId);
+        else
+            captured(row);
+    });
 }
 
 } // namespace rolvane

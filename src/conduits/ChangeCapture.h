@@ -8,6 +8,7 @@
 #include <memory>
 #include <set>
 #include <unordered_map>
+#include <unordered_set>
 #include <vector>
 
 namespace rolvane {
@@ -18,7 +19,9 @@ namespace rolvane {
 class ChangeCapture {
 public:
     // `priorState` is user -> group -> state; a user that is met for the first time gets an empty entry in it.
-    ChangeCapture(ConduitEngine& engine, CXRolvane& rolvane, Dictionary priorState);
+    // `ownProgram`: what it wrote last into a subscribed person came from the publisher. Where such a person is met as
+    // a new member of a group, its data is not carried back; it might replace a newer version.
+    ChangeCapture(ConduitEngine& engine, CXRolvane& rolvane, Dictionary priorState, std::string ownProgram = {});
 
     // The person's data for each location where it is shared, with its choices in each group that lists the person; a
     // person that is new also enters the location's all-contacts group.
@@ -53,13 +56,16 @@ private:
     std::optional<UniqueId> allGroupAt(const RemoteLocation& location, const UserName& user) const;
     void addMember(const UniqueId& member);
     void readNewMembers(const GroupSteps& steps, const CXGroup& group);
+    bool cameFromPublisher(const CXRow& person) const;
 
     ConduitEngine& _engine;
     ContactReader _reader;
     Dictionary _priorState;
+    const std::string _ownProgram;
     CXDChangeRecords _records;
     std::unordered_map<RemoteLocation, Destination> _destinations;
     std::unordered_map<UniqueId, CapturedPerson> _people; // by uniqueId
+    std::unordered_set<UniqueId> _arrived;                // members whose data came from their publisher
     std::set<UniqueId> _underway;                         // groups whose comparison is under way, by uniqueId
 };
 

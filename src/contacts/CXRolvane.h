@@ -24,7 +24,8 @@ struct CXRow {
     RemoteLocation location; // empty for the owner's own
     Date created, modified;
     std::shared_ptr<const Bytes> encoded; // as CXRecord::encodedRepresentation
-    std::vector<UniqueId> parentGroups;   // people only: `uniqueId`s, oldest group first, without all-contacts groups
+    std::string writer; // the program that wrote the properties last, this one where they are unsaved; "" if unknown
+    std::vector<UniqueId> parentGroups; // people only: `uniqueId`s, oldest group first, without all-contacts groups
 };
 
 // One line of a list of people.

@@ -10,7 +10,7 @@ namespace rolvane {
 
 namespace {
 
-constexpr int kFormat = 1;
+constexpr int kFormat = 2;
 constexpr int64_t kApplicationId = 0x52564c43; // "RVLC"
 
 constexpr const char* kTables = R"(
@@ -25,7 +25,8 @@ CREATE TABLE records(
   display TEXT NOT NULL,
   sort TEXT NOT NULL,
   search TEXT NOT NULL,
-  properties BLOB NOT NULL);
+  properties BLOB NOT NULL,
+  writer TEXT NOT NULL DEFAULT '');
 CREATE INDEX records_modified ON records(kind, modified);
 CREATE INDEX records_location ON records(kind, location);
 CREATE TABLE listed(
@@ -97,11 +98,21 @@ void RecordStore::makeOrCheckFormat() {
         throw CXException(kCXDatabaseException, "The file " + _database.path() +
                                                     " is no contact database. Name another file or move it away.");
     int64_t format = _database.integer("PRAGMA user_version");
+    if (format == 1) format = addWriters();
     if (format > kFormat)
         throw CXException(kCXDatabaseException, "The contact database " + _database.path() +
                                                     " was written by a newer version (format " +
                                                     std::to_string(format) + ", this version knows " +
                                                     std::to_string(kFormat) + "). Install that version to open it.");
+}
+
+// Format 1 did not say which program wrote a row.
+int64_t RecordStore::addWriters() {
+    SqliteTransaction transaction(_database);
+    if (_database.integer("PRAGMA user_version") == 1) // nobody else did it meanwhile
+        _database.execute("ALTER TABLE records ADD COLUMN writer TEXT NOT NULL DEFAULT ''; PRAGMA user_version=2;");
+    transaction.commit();
+    return _database.integer("PRAGMA user_version");
 }
 
 void RecordStore::fillNewDatabase() {
@@ -115,9 +126,9 @@ void RecordStore::fillNewDatabase() {
     _database.statement("INSERT INTO meta VALUES('shareCount', ?)").bind(1, count % 1000000000).run();
     Date now = Clock::system().now();
     insertRow(UniqueId(kCXAllGroupUID), RecordKind::allGroup,
-              {{kCXGroupNameProperty, defaultGroupName(RecordKind::allGroup)}}, now, now);
+              {{kCXGroupNameProperty, defaultGroupName(RecordKind::allGroup)}}, now, "");
     insertRow(makeUniqueId(kCXSubscriptionTable), RecordKind::subscription,
-              {{kCXRemoteLocationProperty, kCXLocalRemoteLocation}, {kCXSubscriptionIsAllProperty, false}}, now, now);
+              {{kCXRemoteLocationProperty, kCXLocalRemoteLocation}, {kCXSubscriptionIsAllProperty, false}}, now, "");
 }
 
 uint64_t RecordStore::generation() {
@@ -138,8 +149,8 @@ void RecordStore::setShareCount(int64_t count) {
 }
 
 std::optional<StoredRow> RecordStore::row(const UniqueId& uid) {
-    auto s =
-        _database.statement("SELECT id, uid, kind, location, created, modified, properties FROM records WHERE uid=?");
+    auto s = _database.statement("SELECT id, uid, kind, location, created, modified, properties, writer FROM records "
+                                 "WHERE uid=?");
     if (!s.bind(1, uid.str()).step()) return std::nullopt;
     StoredRow row;
     row.id = s.integer(0);
@@ -149,6 +160,7 @@ std::optional<StoredRow> RecordStore::row(const UniqueId& uid) {
     row.created = Date(s.real(4));
     row.modified = Date(s.real(5));
     row.properties = std::make_shared<const Bytes>(s.bytes(6));
+    row.writer = s.text(7);
     return row;
 }
 
@@ -278,16 +290,17 @@ std::vector<CXRow> RecordStore::scan(RecordKind kind, ScanPosition& position, in
             row.created = Date(s.real(3));
             row.modified = Date(s.real(4));
             row.encoded = std::make_shared<const Bytes>(s.bytes(5));
+            row.writer = s.text(6);
             position = {s.real(4), s.integer(0)};
             ids.push_back(position.id);
             rows.push_back(std::move(row));
         }
     };
-    auto sameDate = _database.statement("SELECT id, uid, location, created, modified, properties FROM records "
+    auto sameDate = _database.statement("SELECT id, uid, location, created, modified, properties, writer FROM records "
                                         "WHERE kind=?1 AND modified=?2 AND id>?3 ORDER BY id LIMIT ?4");
     sameDate.bind(1, static_cast<int>(kind)).bind(2, date).bind(3, position.id).bind(4, limit);
     take(sameDate);
-    auto later = _database.statement("SELECT id, uid, location, created, modified, properties FROM records "
+    auto later = _database.statement("SELECT id, uid, location, created, modified, properties, writer FROM records "
                                      "WHERE kind=?1 AND modified>?2 ORDER BY modified, id LIMIT ?3");
     later.bind(1, static_cast<int>(kind)).bind(2, date).bind(3, limit - static_cast<int>(rows.size()));
     take(later);

@@ -16,6 +16,7 @@ struct StoredRow {
     std::string location;
     Date created, modified;
     std::shared_ptr<const Bytes> properties;
+    std::string writer; // the program that wrote the properties last; "" when unknown
 };
 
 struct StoredChoice {
@@ -69,8 +70,10 @@ public:
     void forEachLine(RecordKind kind, const std::function<void(Line)>& call);
 
     // Within a transaction ---------------------------------------------------------------------------------------
-    void insertRow(const UniqueId& uid, RecordKind kind, const Dictionary& properties, Date created, Date modified);
-    void updateRow(int64_t id, RecordKind kind, const Dictionary& properties, const Bytes& encoded, Date modified);
+    void insertRow(const UniqueId& uid, RecordKind kind, const Dictionary& properties, Date created,
+                   const std::string& writer);
+    void updateRow(int64_t id, RecordKind kind, const Dictionary& properties, const Bytes& encoded, Date modified,
+                   const std::string& writer);
     void removeRow(int64_t id);
     void setModified(int64_t id, Date modified);
     void touchParents(int64_t member, Date modified);
@@ -84,6 +87,7 @@ public:
 
 private:
     void makeOrCheckFormat();
+    int64_t addWriters(); // the format then
     void fillNewDatabase();
     void addParents(std::vector<CXRow>& rows, const std::vector<int64_t>& ids);
 

@@ -7,24 +7,26 @@
 namespace rolvane {
 
 void RecordStore::insertRow(const UniqueId& uid, RecordKind kind, const Dictionary& properties, Date created,
-                            Date modified) {
+                            const std::string& writer) {
     DerivedColumns columns = deriveColumns(kind, properties);
     Bytes encoded = BinaryValue::encode(properties);
     auto s = _database.statement("INSERT INTO records(uid, kind, location, created, modified, display, sort, search, "
-                                 "properties) VALUES(?,?,?,?,?,?,?,?,?)");
+                                 "properties, writer) VALUES(?,?,?,?,?,?,?,?,?,?)");
     s.bind(1, uid.str()).bind(2, static_cast<int>(kind)).bind(3, columns.location);
-    s.bind(4, created.secondsSince1970()).bind(5, modified.secondsSince1970());
-    s.bind(6, columns.display).bind(7, columns.sort).bind(8, columns.search).bind(9, encoded).run();
+    s.bind(4, created.secondsSince1970()).bind(5, created.secondsSince1970());
+    s.bind(6, columns.display).bind(7, columns.sort).bind(8, columns.search).bind(9, encoded);
+    s.bind(10, std::string_view(writer)).run();
 }
 
 void RecordStore::updateRow(int64_t id, RecordKind kind, const Dictionary& properties, const Bytes& encoded,
-                            Date modified) {
+                            Date modified, const std::string& writer) {
     DerivedColumns columns = deriveColumns(kind, properties);
     auto s =
         _database.statement("UPDATE records SET kind=?2, location=?3, modified=?4, display=?5, sort=?6, search=?7, "
-                            "properties=?8 WHERE id=?1");
+                            "properties=?8, writer=?9 WHERE id=?1");
     s.bind(1, id).bind(2, static_cast<int>(kind)).bind(3, columns.location).bind(4, modified.secondsSince1970());
-    s.bind(5, columns.display).bind(6, columns.sort).bind(7, columns.search).bind(8, encoded).run();
+    s.bind(5, columns.display).bind(6, columns.sort).bind(7, columns.search).bind(8, encoded);
+    s.bind(9, std::string_view(writer)).run();
 }
 
 void RecordStore::removeRow(int64_t id) {

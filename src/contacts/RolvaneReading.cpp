@@ -120,6 +120,7 @@ std::optional<CXRow> CXRolvane::Impl::row(const UniqueId& uid, bool withParents)
     row.modified = modified(uid);
     row.created = property(uid, kCXCreationDateProperty).date().value_or(Date());
     row.encoded = encoded(uid);
+    row.writer = work.find(uid) || !storedRow(uid) ? options.program : storedRow(uid)->writer;
     if (withParents) row.parentGroups = parents(uid);
     return row;
 }

@@ -64,7 +64,7 @@ private:
         std::optional<StoredRow> row = _store.row(uid);
         if (!row && record.isInsertion()) {
             if (isSubscribedMeanwhile(record)) return;
-            _store.insertRow(uid, record.kind, record.over({}), _date, _date);
+            _store.insertRow(uid, record.kind, record.over({}), _date, _program);
             if (!isAllKind(record.kind)) note(uid, CXChangeKind::inserted);
             return;
         }
@@ -86,7 +86,7 @@ private:
         Dictionary after = record.over(before);
         Bytes encoded = BinaryValue::encode(after);
         if (encoded == *row.properties && record.kind == row.kind) return; // nothing has changed after all
-        _store.updateRow(row.id, record.kind, after, encoded, _date);
+        _store.updateRow(row.id, record.kind, after, encoded, _date, _program);
         note(record.kind == RecordKind::allGroup ? UniqueId(_identity + ":" + std::string(kCXInfoTable)) : uid,
              CXChangeKind::updated);
     }

@@ -407,7 +407,7 @@ TEST_F(Apply, ALocationThatIsItsOwnBaseLocationKeepsItsManager) {
             return Url("http://store.example/" + user.value_or(UserName()).str() + "/Contacts");
         }
     };
-    WithLocations rooted(engine, {database, preferences, clock, center, 1});
+    WithLocations rooted(engine, {database, preferences, clock, center, 1, "another program"});
     const auto first = rooted.ACLManagerForRemoteLocation(Url(kBobsLocation.str()));
     EXPECT_EQ(rooted.ACLManagerForRemoteLocation(Url(kBobsLocation.str())), first);
     EXPECT_EQ(rooted.ACLManagerForRemoteLocation(Url(kBobsLocation.str() + "/Friends")), first);

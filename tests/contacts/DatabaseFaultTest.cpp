@@ -28,10 +28,25 @@ std::string reasonOf(const std::function<void()>& work) {
 TEST(DatabaseFault, AFileOfANewerFormatIsRefusedAndLeftAlone) {
     TestDatabase d;
     d.database.reset();
-    Sqlite(d.path, 0).execute("PRAGMA user_version=2");
+    Sqlite(d.path, 0).execute("PRAGMA user_version=3");
     std::string told = reasonOf([&] { d.open(); });
     EXPECT_TELLS(told, "newer version");
     EXPECT_TELLS(told, d.path);
+    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 3);
+}
+
+TEST(DatabaseFault, AFileOfTheFormerFormatLearnsWhoWroteWhat) {
+    TestDatabase d;
+    d.addPerson("Ada", "A:CXPerson");
+    d->save();
+    d.database.reset();
+    Sqlite(d.path, 0).execute("ALTER TABLE records DROP COLUMN writer; PRAGMA user_version=1");
+    d.database = d.open("rolvane");
+    EXPECT_EQ(d->personRow(UniqueId("A:CXPerson"))->writer, "") << "nobody knows";
+    d->recordForUniqueId(UniqueId("A:CXPerson"))->setValue(Value("Adele"), kCXFirstNameProperty);
+    d->save();
+    EXPECT_EQ(d->personRow(UniqueId("A:CXPerson"))->writer, "rolvane");
+    d.database.reset();
     EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 2);
 }
 
