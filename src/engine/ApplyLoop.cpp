@@ -9,6 +9,7 @@
 #include "foundation/Log.h"
 
 #include <algorithm>
+#include <charconv>
 #include <iterator>
 #include <utility>
 
@@ -28,6 +29,16 @@ CXDChangeRecords mingled(const CXDChangeRecords& input) {
     Mingler mingler;
     for (const CXDChangeRecordPtr& record : input) mingler.mingle(record);
     return mingler.takeMingled();
+}
+
+// A number, or a text that is one.
+int64_t configuredWorkers(const NetworkAccount& account) {
+    const Value configured = account.configValueForKey(kThreadCountKey, kDefaultWorkers);
+    const std::string* text = configured.stringIf();
+    if (!text) return configured.integer(kDefaultWorkers);
+    int64_t workers = kDefaultWorkers;
+    const auto [end, error] = std::from_chars(text->data(), text->data() + text->size(), workers);
+    return error == std::errc() && end == text->data() + text->size() ? workers : kDefaultWorkers;
 }
 
 } // namespace
@@ -109,9 +120,7 @@ void ApplyLoop::split() {
 }
 
 void ApplyLoop::applyOutOfOrder() {
-    const int64_t configured =
-        _parts.with.account.configValueForKey(kThreadCountKey, kDefaultWorkers).integer(kDefaultWorkers);
-    _outOfOrder->start(std::min(configured, kMostWorkers));
+    _outOfOrder->start(std::min(configuredWorkers(_parts.with.account), kMostWorkers));
     _outOfOrder->wait();
     _processedCount += _outOfOrder->processedCount();
 }

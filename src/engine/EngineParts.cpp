@@ -1,6 +1,7 @@
 #include "engine/EngineParts.h"
 
 #include "contacts/CXRolvane.h"
+#include "foundation/CXException.h"
 #include "foundation/Log.h"
 #include "model/PayloadKeys.h"
 #include "model/RemoteLocationMap.h"
@@ -42,7 +43,11 @@ void killCXD(const EngineParts& parts) {
     parts.with.progress.stop();
     if (std::this_thread::get_id() == parts.mainThread) {
         parts.ending = true; // whatever arrives in that turn starts no pass
-        parts.with.runLoop.runOnce(0);
+        try {
+            parts.with.runLoop.runOnce(0);
+        } catch (const CXException& e) { // what could not be taken any more waits for the next process
+            CXDLog("Left for the next run: %@", e);
+        }
     }
     CXDLog("Killing RolvaneManager");
     parts.with.processEnd.end(0);

@@ -57,14 +57,16 @@ void EngineState::syncPrefs() {
 }
 
 CXDChangeRecords EngineState::getPendingChanges() const {
-    const Value stored = _preferences.get(kDaemonDomain, kCXDPendingChanges);
     CXDChangeRecords records;
-    if (!stored.isData()) return records;
     try {
+        const Value stored = _preferences.get(kDaemonDomain, kCXDPendingChanges);
+        if (!stored.isData()) return records;
         for (KeyedArchive::Object& object : KeyedArchive::unarchive(stored.data()))
             if (object.className == kRecordClass)
                 records.push_back(std::make_shared<CXDChangeRecord>(DictionaryCoder(std::move(object.keys))));
-    } catch (const CXException&) {
+    } catch (const CXException& e) {
+        // What does not unarchive is no queue. A file that cannot be read just now is something else: its queue stays.
+        if (e.name() == kCXPreferencesException) throw;
         records.clear();
     }
     return records;

@@ -60,7 +60,7 @@ void foldStructure(Dictionary& state, const CXDChangeRecord& record, const std::
     const bool named = record.type() == CXDCreateStructureForGroup || record.type() == CXDChangeGroupName;
     const Value payload = named ? record.inMemoryPayload() : Value();
     if (record.type() == CXDCreateStructureForGroup)
-        if (const Value name = payload.dictionary()[kCXGroupNameProperty]) state.set(kCXGroupNameProperty, name);
+        if (const Value& name = payload.dictionary()[kCXGroupNameProperty]) state.set(kCXGroupNameProperty, name);
     if (person)
         appendOnce(members, *person);
     else if (record.type() == CXDChangeGroupName && payload)

@@ -35,7 +35,7 @@ struct Preferences::Impl {
             return BinaryValue::decode(bytes);
         } catch (const CXException& e) {
             throw CXException(
-                kCXPreferencesException,
+                kCXArchiveException,
                 fmt::format("The value of \"{}\" in the domain \"{}\" of the preferences file \"{}\" is damaged "
                             "({}). It was left as it is. Restore the file from a backup, or delete the value.",
                             key, domain, file.path(), e.reason()));

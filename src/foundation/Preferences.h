@@ -13,9 +13,10 @@ namespace rolvane {
 // visible to this process's reads at once, until `synchronize` writes them in one transaction; reads of keys that have
 // no unwritten change see what other processes have synchronised. Values are BinaryValue blobs. Any thread.
 // A damaged file throws kCXPreferencesException that names the file and says how to go on; it is never overwritten.
-// So do a locked file (after the lock timeout), a read-only one and a full disk: nothing of the transaction is written,
-// and the changes stay in memory for the next `synchronize`. Several processes may use one file at a time. A value is
-// copied when it is set: what happens to its containers afterwards changes nothing here.
+// A value whose bytes are damaged throws kCXArchiveException when it is asked for, and is left as it is, too.
+// A locked file (after the lock timeout), a read-only one and a full disk are reported like a damaged file: nothing of
+// the transaction is written, and the changes stay in memory for the next `synchronize`. Several processes may use one
+// file at a time. A value is copied when it is set: what happens to its containers afterwards changes nothing here.
 class Preferences {
 public:
     // The file is made on the first write, mode 0600, directories 0700. Nothing is opened before it is needed.

@@ -168,13 +168,9 @@ void RunLoop::Impl::runHandler(Watch& watch) {
         }
     } rearm{watch};
     Raised handling(inHandler);
-    try {
-        if (watch.ready) return watch.ready(watch.events);
-        auto fire = std::move(watch.fire); // once; what it holds ends with the call
-        fire();
-    } catch (const CXException& e) {
-        CXLog("Exception in an event handler: %@", e);
-    }
+    if (watch.ready) return watch.ready(watch.events);
+    auto fire = std::move(watch.fire); // once; what it holds ends with the call
+    fire();
 }
 
 void RunLoop::Impl::turn(double waitSeconds) {

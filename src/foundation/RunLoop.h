@@ -11,8 +11,8 @@ struct sd_event;
 namespace rolvane {
 
 // A run loop on sd-event. One per thread that asks for it; all but `wake` is called on its own thread.
-// Handlers run on the loop's thread, never nested inside one another. A CXException that leaves a handler is logged and
-// ends nothing; any other exception leaves `run…` and reaches its caller.
+// Handlers run on the loop's thread, never nested inside one another. An exception that leaves a handler leaves `run…`
+// and reaches its caller; the loop can be run again, and what was due stays due.
 //
 // A turn has two halves. First sd-event dispatches what is ready: connections attached to `event` move their bytes,
 // timers and ports only note that their handler is due. Then the handlers that are due run, in the order in which they

@@ -216,7 +216,7 @@ CXDChangeRecord::CXDChangeRecord(const Coder& coder) {
 CXDChangeRecordPtr CXDChangeRecord::copy() const {
     auto made = std::make_shared<CXDChangeRecord>(_initialSource, _changeType, _user, _puid, _guid);
     made->_payload = _payload;
-    made->_appliesToSources = _appliesToSources;
+    made->_appliesToSources = appliesToSources();
     return made;
 }
 
@@ -290,7 +290,7 @@ bool CXDChangeRecord::changeMadeByDataOwner() const {
 }
 
 std::optional<RemoteLocation> CXDChangeRecord::remoteLocation(const RecordLocator& locator) const {
-    const int32_t source = _initialSource == CXDSyncSourceCX ? _appliesToSources : _initialSource;
+    const int32_t source = _initialSource == CXDSyncSourceCX ? appliesToSources() : _initialSource;
     return locator.baseLocation(source, _user);
 }
 

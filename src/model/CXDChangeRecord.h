@@ -5,6 +5,7 @@
 #include "foundation/Url.h"
 #include "foundation/Value.h"
 
+#include <atomic>
 #include <compare>
 #include <cstdint>
 #include <memory>
@@ -121,7 +122,7 @@ private:
     struct Payload; // shared by copies: the value, or its encoded form until it is first read
     int32_t _changeType = 0;
     int32_t _initialSource = 0;
-    int32_t _appliesToSources = 0;
+    std::atomic<int32_t> _appliesToSources = 0; // a worker sets its own record's while others compare with it
     int32_t _appliedToSources = 0;
     std::optional<UniqueId> _puid;
     std::optional<UniqueId> _guid;

@@ -3,6 +3,7 @@
 #include "foundation/Paths.h"
 
 #include <fstream>
+#include <sqlite3.h>
 
 namespace rolvane::test {
 namespace {
@@ -10,6 +11,13 @@ namespace {
 constexpr const char* kPassStarted = "Sharing synchronization update started.";
 constexpr const char* kPassCompleted = "Sharing synchronization update completed.";
 constexpr double kAWhile = 0.3; // long enough for a timer of zero seconds to fire
+
+void executeSql(const std::string& path, const char* statement) {
+    sqlite3* file = nullptr;
+    ASSERT_EQ(sqlite3_open(path.c_str(), &file), SQLITE_OK);
+    EXPECT_EQ(sqlite3_exec(file, statement, nullptr, nullptr, nullptr), SQLITE_OK) << sqlite3_errmsg(file);
+    sqlite3_close(file);
+}
 
 class StartUp : public testing::Test {
 protected:
@@ -128,6 +136,30 @@ TEST_F(StartUp, DamagedPreferencesEndItWithOneLineAndStatusZero) {
     const std::string path = stateDirectory() + "/preferences.db";
     std::ofstream(path) << "these are no preferences, and have never been any, however long one looks at them";
     endsWithOneLineAbout(world, path);
+}
+
+TEST_F(StartUp, AnErrorThatReachesTheRunLoopEndsItWithOneLineAndStatusZeroAndLosesNothing) {
+    world.bus();
+    world.addPeople(2);
+    world.saveAccountOn(world.store());
+    world.publishEverything();
+    const auto daemon = world.serving();
+    for (int i = 0; i < 600 && !world.differences().empty(); ++i) daemon->wait(0.05);
+    ASSERT_EQ(world.differences(), "") << daemon->errors();
+
+    world.closeDatabase();
+    const std::string path = dataDirectory() + "/contacts.db";
+    executeSql(path, "ALTER TABLE cursors RENAME TO mislaid");
+    const auto ending = daemon->wait();
+    ASSERT_TRUE(ending) << daemon->errors();
+    EXPECT_TRUE(ending->exitedWith(0)) << daemon->errors();
+    EXPECT_EQ(linesWith(daemon->errors(), "Quitting due to an unhandled exception: "), 1U) << daemon->errors();
+
+    executeSql(path, "ALTER TABLE mislaid RENAME TO cursors");
+    world.addPeople(1, "Newcomer");
+    const auto next = world.serving();
+    for (int i = 0; i < 600 && !world.differences().empty(); ++i) next->wait(0.05);
+    EXPECT_EQ(world.differences(), "") << next->errors();
 }
 
 TEST_F(StartUp, APasswordThatCannotBeHadEndsItWithStatusZero) {

@@ -5,6 +5,7 @@
 #include "support/CapturingLog.h"
 
 #include <gtest/gtest.h>
+#include <sqlite3.h>
 
 namespace rolvane {
 namespace {
@@ -92,6 +93,15 @@ TEST(EngineMemory, AQueueThatCannotBeReadIsEmptyAndNothingIsLogged) {
         world.preferences.set(kDaemonDomain, "CXDPendingChanges", damaged);
         EXPECT_TRUE(state.getPendingChanges().empty());
     }
+    world.preferences.synchronize(kDaemonDomain);
+    sqlite3* file = nullptr;
+    ASSERT_EQ(sqlite3_open(world.preferences.path().c_str(), &file), SQLITE_OK);
+    EXPECT_EQ(sqlite3_exec(file, "UPDATE preferences SET value = x'ffff' WHERE key = 'CXDPendingChanges'", nullptr,
+                           nullptr, nullptr),
+              SQLITE_OK);
+    EXPECT_EQ(sqlite3_changes(file), 1);
+    sqlite3_close(file);
+    EXPECT_TRUE(state.getPendingChanges().empty()) << "bytes that are no value at all";
     EXPECT_TRUE(log.lines().empty()) << log.text();
 }
 

@@ -58,6 +58,18 @@ TEST_F(Workers, AreThreeUnlessConfiguredOtherwise) {
     EXPECT_EQ(world.progress.did, 12);
 }
 
+TEST_F(Workers, AreCountedByATextThatIsANumber) {
+    world.account.threads = "5";
+    Gate gate(5);
+    std::atomic<int> calls{0};
+    world.vaultra->whenApplying = [&](const CXDChangeRecordPtr&, bool*) {
+        if (++calls <= 5) gate.pass();
+        return true;
+    };
+    world.engine->applyChangeRecords(updates(20));
+    EXPECT_EQ(world.vaultra->threads(), 5u);
+}
+
 TEST_F(Workers, AreTenAtMost) {
     world.account.threads = 50;
     Gate gate(10);

@@ -48,17 +48,18 @@ struct PreferencesOf : testing::Test {
         preferences.set("domain", key, std::move(value));
         preferences.synchronize("domain");
     }
-    std::string complaintOf(const std::function<void()>& work) {
+    std::string complaintOf(const std::function<void()>& work, const char* name = kCXPreferencesException) {
         try {
             work();
         } catch (const CXException& e) {
-            EXPECT_EQ(e.name(), kCXPreferencesException);
+            EXPECT_EQ(e.name(), name);
             return e.reason();
         }
         return "nothing was thrown";
     }
-    void expectComplaint(const std::function<void()>& work, const std::vector<std::string>& parts) {
-        std::string complaint = complaintOf(work);
+    void expectComplaint(const std::function<void()>& work, const std::vector<std::string>& parts,
+                         const char* name = kCXPreferencesException) {
+        std::string complaint = complaintOf(work, name);
         for (const auto& part : parts)
             EXPECT_NE(complaint.find(part), std::string::npos) << part << " in: " << complaint;
         EXPECT_NE(complaint.find(path), std::string::npos) << complaint;
@@ -268,7 +269,8 @@ TEST_F(PreferencesOf, ADamagedValueIsNamedAndTheOthersAreStillRead) {
     store("good", 1);
     store("bad", 2);
     sqlite("UPDATE preferences SET value = x'ffffffff' WHERE key = 'bad'");
-    expectComplaint([&] { (void)preferences.get("domain", "bad"); }, {"\"bad\"", "\"domain\"", "damaged"});
+    expectComplaint([&] { (void)preferences.get("domain", "bad"); }, {"\"bad\"", "\"domain\"", "damaged"},
+                    kCXArchiveException);
     EXPECT_EQ(preferences.get("domain", "good"), Value(1));
 }
 
