@@ -122,6 +122,44 @@ RemoteLocation CXRecord::remoteLocation() const {
     return RemoteLocation(database->impl().location(_uid));
 }
 
+namespace {
+
+// The location whose publisher decides; empty where the owner does.
+RemoteLocation publishedAt(const CXRecord& record) {
+    const auto* subscription = dynamic_cast<const CXSubscription*>(&record);
+    if (!subscription) return record.isSubscribed() ? record.remoteLocation() : RemoteLocation();
+    return subscription->isLocal() ? RemoteLocation() : subscription->remoteLocation();
+}
+
+std::string shownName(const CXRecord& record) {
+    if (const auto* person = dynamic_cast<const CXPerson*>(&record)) return person->displayName();
+    if (const auto* group = dynamic_cast<const CXGroup*>(&record)) return group->name();
+    const auto* subscription = dynamic_cast<const CXSubscription*>(&record);
+    return subscription ? subscription->name() : std::string();
+}
+
+} // namespace
+
+bool CXRecord::isWritable() const {
+    const RemoteLocation location = publishedAt(*this);
+    if (location.empty()) return !isSubscribed();
+    CXRolvane* database = owner();
+    if (!database) return false;
+    const CXAllGroupRef all = database->allGroupForRemoteLocation(location);
+    const auto writers = all ? all->multiValueForProperty(kCXReadWriteSharingACLProperty) : std::nullopt;
+    return writers && !writers->empty();
+}
+
+std::string CXRecord::readOnlyReason() const {
+    if (isWritable()) return {};
+    const std::string name = shownName(*this);
+    const RemoteLocation location = publishedAt(*this);
+    const std::string what = name.empty() ? "This" : "\"" + name + "\"";
+    if (location.empty()) return what + " is a copy of somebody else's data and belongs to no subscription any more.";
+    return what + " came by the subscription to " + location.str() +
+           ", which may be read but not changed. Ask its publisher for the right to write, or make a copy of your own.";
+}
+
 bool CXRecord::isAttached() const {
     CXRolvane* database = owner();
     if (!database) return false;

@@ -66,6 +66,14 @@ public:
     // Of a subscribed record: the location that it came from. Empty for the owner's own records.
     RemoteLocation remoteLocation() const;
 
+    // May its person edit or delete the record? The owner's own: yes. What came by a subscription: when the publisher
+    // has granted writing, which is when kCXReadWriteSharingACLProperty of the location's all-contacts group has
+    // entries; never once the subscription is gone. Nothing enforces the answer here (the daemon writes copies whatever
+    // it is): whoever edits for a person asks first. Of a subscription: may what came by it be edited?
+    bool isWritable() const;
+    // Why not, with what to do, to be shown to the person; "" when it is writable.
+    std::string readOnlyReason() const;
+
     bool isAttached() const; // belongs to a database and is not deleted
     bool hasUnsavedChanges() const;
     CXRolvane* rolvane() const; // null when it belongs to none; borrowed

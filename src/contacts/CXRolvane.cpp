@@ -131,6 +131,11 @@ bool CXRolvane::hasUnsavedChanges() const {
     return !_impl->work.empty();
 }
 
+size_t CXRolvane::unsavedSize() const {
+    std::lock_guard lock(_impl->mutex);
+    return _impl->work.size();
+}
+
 void CXRolvane::rollback() {
     std::lock_guard lock(_impl->mutex);
     _impl->work.clear();

@@ -117,7 +117,8 @@ public:
     // location at a time, the first one's subscription stays. True always; throws on failure.
     bool save();
     bool hasUnsavedChanges() const;
-    void rollback(); // drops the unsaved changes; handles of records that were only added become empty
+    size_t unsavedSize() const; // bytes of content that wait in memory for the save, roughly
+    void rollback();            // drops the unsaved changes; handles of records that were only added become empty
 
     // Identity and share count -----------------------------------------------------------------------------------
     // Made with the file, kept through everything but a new file.

@@ -125,10 +125,13 @@ void RecordStore::fillNewDatabase() {
     for (char c : makeUUID().substr(0, 6)) count = count * 37 + c;
     _database.statement("INSERT INTO meta VALUES('shareCount', ?)").bind(1, count % 1000000000).run();
     Date now = Clock::system().now();
-    insertRow(UniqueId(kCXAllGroupUID), RecordKind::allGroup,
-              {{kCXGroupNameProperty, defaultGroupName(RecordKind::allGroup)}}, now, "");
-    insertRow(makeUniqueId(kCXSubscriptionTable), RecordKind::subscription,
-              {{kCXRemoteLocationProperty, kCXLocalRemoteLocation}, {kCXSubscriptionIsAllProperty, false}}, now, "");
+    const auto add = [&](const UniqueId& uid, RecordKind kind, const Dictionary& properties) {
+        insertRow(uid, kind, properties, BinaryValue::encode(properties), now, "");
+    };
+    add(UniqueId(kCXAllGroupUID), RecordKind::allGroup,
+        {{kCXGroupNameProperty, defaultGroupName(RecordKind::allGroup)}});
+    add(makeUniqueId(kCXSubscriptionTable), RecordKind::subscription,
+        {{kCXRemoteLocationProperty, kCXLocalRemoteLocation}, {kCXSubscriptionIsAllProperty, false}});
 }
 
 uint64_t RecordStore::generation() {

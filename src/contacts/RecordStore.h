@@ -70,8 +70,8 @@ public:
     void forEachLine(RecordKind kind, const std::function<void(Line)>& call);
 
     // Within a transaction ---------------------------------------------------------------------------------------
-    void insertRow(const UniqueId& uid, RecordKind kind, const Dictionary& properties, Date created,
-                   const std::string& writer);
+    void insertRow(const UniqueId& uid, RecordKind kind, const Dictionary& properties, const Bytes& encoded,
+                   Date created, const std::string& writer);
     void updateRow(int64_t id, RecordKind kind, const Dictionary& properties, const Bytes& encoded, Date modified,
                    const std::string& writer);
     void removeRow(int64_t id);

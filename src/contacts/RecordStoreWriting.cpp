@@ -6,10 +6,9 @@
 
 namespace rolvane {
 
-void RecordStore::insertRow(const UniqueId& uid, RecordKind kind, const Dictionary& properties, Date created,
-                            const std::string& writer) {
+void RecordStore::insertRow(const UniqueId& uid, RecordKind kind, const Dictionary& properties, const Bytes& encoded,
+                            Date created, const std::string& writer) {
     DerivedColumns columns = deriveColumns(kind, properties);
-    Bytes encoded = BinaryValue::encode(properties);
     auto s = _database.statement("INSERT INTO records(uid, kind, location, created, modified, display, sort, search, "
                                  "properties, writer) VALUES(?,?,?,?,?,?,?,?,?,?)");
     s.bind(1, uid.str()).bind(2, static_cast<int>(kind)).bind(3, columns.location);

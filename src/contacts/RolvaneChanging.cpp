@@ -78,7 +78,7 @@ bool CXRolvane::Impl::setProperty(const UniqueId& uid, std::string_view name, Va
     if (is == RecordKind::none || is >= RecordKind::groupContents || !mayHave(is, name, value)) return false;
     if (is == RecordKind::subscription && name == kCXRemoteLocationProperty) return false;
     PendingRecord& p = pending(uid);
-    if (value.isAbsent() && p.replaced)
+    if (value.isAbsent() && p.replaced && !p.whole)
         p.changes.erase(std::string(name));
     else
         p.changes[std::string(name)] = value.deepMutableCopy();
@@ -94,17 +94,15 @@ void CXRolvane::Impl::replaceProperties(const UniqueId& uid, Dictionary fresh) {
                                                          : nullptr;
     if (keeps && (is == RecordKind::subscription || !mayHave(is, keeps, fresh[keeps])))
         fresh.set(keeps, property(uid, keeps));
+    for (const char* kept : {kCXUIDProperty, kCXCreationDateProperty, kCXModificationDateProperty}) fresh.remove(kept);
     PendingRecord& p = pending(uid);
-    p.replaced = true;
-    p.changes.clear();
-    for (const auto& [name, value] : fresh)
-        if (!isKeptByDatabase(name)) p.changes[name] = value;
+    work.replace(p, fresh);
     p.location = locationOf(is, fresh);
 }
 
 void CXRolvane::Impl::insert(const UniqueId& uid, RecordKind is, const Dictionary& fresh) {
     PendingRecord& p = work.insert(uid, is, storedRow(uid).has_value(), clock.now());
-    for (const auto& [name, value] : fresh) p.changes[name] = value;
+    work.replace(p, fresh);
     p.location = locationOf(is, fresh);
 }
 

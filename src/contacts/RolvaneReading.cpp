@@ -67,7 +67,8 @@ RecordKind CXRolvane::Impl::kind(const UniqueId& uid) {
 Dictionary CXRolvane::Impl::properties(const UniqueId& uid) {
     if (kind(uid) == RecordKind::none) return {};
     const PendingRecord* p = work.find(uid);
-    return p ? p->over(storedProperties(uid).mutableCopy()) : storedProperties(uid).mutableCopy();
+    if (!p) return storedProperties(uid).mutableCopy();
+    return p->over(p->replaced ? kNoProperties : storedProperties(uid));
 }
 
 Value CXRolvane::Impl::property(const UniqueId& uid, std::string_view name) {
@@ -83,6 +84,7 @@ Value CXRolvane::Impl::property(const UniqueId& uid, std::string_view name) {
     }
     if (p) {
         if (auto changed = p->changes.find(name); changed != p->changes.end()) return changed->second.deepMutableCopy();
+        if (p->whole) return BinaryValue::decode(*p->whole).dictionary()[name];
         if (p->replaced) return {};
     }
     return storedProperties(uid)[name].deepMutableCopy();
@@ -90,6 +92,7 @@ Value CXRolvane::Impl::property(const UniqueId& uid, std::string_view name) {
 
 std::shared_ptr<const Bytes> CXRolvane::Impl::encoded(const UniqueId& uid) {
     const PendingRecord* p = work.find(uid);
+    if (p && p->whole && p->changes.empty()) return p->whole;
     if (!p) {
         if (const auto& row = storedRow(uid)) return row->properties;
     }
@@ -148,6 +151,7 @@ std::vector<UniqueId> CXRolvane::Impl::listed(const UniqueId& group, bool groups
     });
     if (!changes) return all;
     for (const UniqueId& uid : changes->added) {
+        if (uid.empty()) continue;
         RecordKind is = kind(uid);
         if (groups ? isPlainGroup(is) : isPerson(is)) all.push_back(uid);
     }
@@ -208,7 +212,8 @@ std::map<UniqueId, CXDistributionChoices> CXRolvane::Impl::choicesOfGroup(const 
             if (counts(c)) all[c.record][c.property] = c.identifier;
     if (!changes) return all;
     // Unsaved choices, and what is stored for people who are not stored as members yet.
-    std::set<UniqueId> people = changes->addedSet;
+    std::set<UniqueId> people;
+    for (const auto& [person, place] : changes->addedSet) people.insert(person);
     for (const auto& [person, chosen] : changes->choices) people.insert(person);
     for (const UniqueId& person : people) {
         all.erase(person);

@@ -64,7 +64,8 @@ private:
         std::optional<StoredRow> row = _store.row(uid);
         if (!row && record.isInsertion()) {
             if (isSubscribedMeanwhile(record)) return;
-            _store.insertRow(uid, record.kind, record.over({}), _date, _program);
+            Dictionary properties = record.over({});
+            _store.insertRow(uid, record.kind, properties, encodedOf(record, properties), _date, _program);
             if (!isAllKind(record.kind)) note(uid, CXChangeKind::inserted);
             return;
         }
@@ -81,10 +82,14 @@ private:
         return once && _store.firstOfLocation(record.kind, record.location).has_value();
     }
 
+    static Bytes encodedOf(const PendingRecord& record, const Dictionary& properties) {
+        return record.whole && record.changes.empty() ? *record.whole : BinaryValue::encode(properties);
+    }
+
     void updateRow(const UniqueId& uid, const PendingRecord& record, const StoredRow& row) {
         Dictionary before = record.replaced ? Dictionary() : BinaryValue::decode(*row.properties).dictionary();
         Dictionary after = record.over(before);
-        Bytes encoded = BinaryValue::encode(after);
+        Bytes encoded = encodedOf(record, after);
         if (encoded == *row.properties && record.kind == row.kind) return; // nothing has changed after all
         _store.updateRow(row.id, record.kind, after, encoded, _date, _program);
         note(record.kind == RecordKind::allGroup ? UniqueId(_identity + ":" + std::string(kCXInfoTable)) : uid,
@@ -98,7 +103,8 @@ private:
         for (const UniqueId& member : changes.removed) changed |= _store.removeListed(number, _store.rowNumber(member));
         for (const UniqueId& person : changes.choicesDropped)
             changed |= _store.removeChoices(number, _store.rowNumber(person));
-        for (const UniqueId& member : changes.added) changed |= addMember(group, number, member);
+        for (const UniqueId& member : changes.added)
+            if (!member.empty()) changed |= addMember(group, number, member);
         for (const auto& [person, chosen] : changes.choices) changed |= writeChoices(number, person, chosen);
         if (!changed) return;
         _store.setModified(number, _date);

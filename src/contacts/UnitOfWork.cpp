@@ -1,11 +1,15 @@
 #include "contacts/UnitOfWork.h"
 
+#include "foundation/PropertyList.h"
+
 #include <algorithm>
 
 namespace rolvane {
 
 Dictionary PendingRecord::over(const Dictionary& stored) const {
-    Dictionary result = replaced ? Dictionary() : stored;
+    Dictionary result = whole      ? BinaryValue::decode(*whole).dictionary()
+                        : replaced ? Dictionary()
+                                   : stored.mutableCopy();
     for (const auto& [property, value] : changes) {
         if (value.isAbsent())
             result.remove(property);
@@ -17,20 +21,25 @@ Dictionary PendingRecord::over(const Dictionary& stored) const {
 
 void PendingMembership::add(const UniqueId& member) {
     if (removed.erase(member)) return; // keeps its place
-    if (addedSet.insert(member).second) added.push_back(member);
+    if (addedSet.emplace(member, added.size()).second) added.push_back(member);
+}
+
+bool PendingMembership::takeBack(const UniqueId& member) {
+    auto found = addedSet.find(member);
+    if (found == addedSet.end()) return false;
+    added[found->second] = UniqueId();
+    addedSet.erase(found);
+    return true;
 }
 
 void PendingMembership::remove(const UniqueId& member) {
     choices.erase(member);
     choicesDropped.insert(member);
-    if (addedSet.erase(member))
-        std::erase(added, member);
-    else
-        removed.insert(member);
+    if (!takeBack(member)) removed.insert(member);
 }
 
 void PendingMembership::forget(const UniqueId& member) {
-    if (addedSet.erase(member)) std::erase(added, member);
+    takeBack(member);
     removed.erase(member);
     choices.erase(member);
     choicesDropped.erase(member);
@@ -40,6 +49,15 @@ void UnitOfWork::clear() {
     _records.clear();
     _memberships.clear();
     _shareCount.reset();
+    _size = 0;
+}
+
+void UnitOfWork::replace(PendingRecord& record, const Dictionary& properties) {
+    if (record.whole) _size -= record.whole->size();
+    record.replaced = true;
+    record.changes.clear();
+    record.whole = std::make_shared<const Bytes>(BinaryValue::encode(properties));
+    _size += record.whole->size();
 }
 
 const PendingRecord* UnitOfWork::find(const UniqueId& uid) const {
@@ -65,8 +83,7 @@ PendingRecord& UnitOfWork::insert(const UniqueId& uid, RecordKind kind, bool inS
     if (wasDeleted) record.order = _nextOrder++;
     record.kind = kind;
     record.deleted = false;
-    record.replaced = true;
-    record.changes.clear();
+    replace(record, {});
     return record;
 }
 
@@ -77,6 +94,8 @@ void UnitOfWork::remove(const UniqueId& uid, RecordKind kind, bool inStore, Date
         at = drop ? _memberships.erase(at) : std::next(at);
     }
     PendingRecord& record = touch(uid, kind, inStore, now);
+    if (record.whole) _size -= record.whole->size();
+    record.whole.reset();
     if (!record.inStore) {
         _records.erase(uid);
         return;

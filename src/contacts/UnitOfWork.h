@@ -2,8 +2,10 @@
 
 #include "contacts/RecordKind.h"
 #include "foundation/StrongString.h"
+#include "foundation/Value.h"
 
 #include <map>
+#include <memory>
 #include <optional>
 #include <set>
 #include <string>
@@ -19,29 +21,32 @@ struct PendingRecord {
     bool inStore = false; // there was a row when the record was first touched
     bool deleted = false;
     bool purged = false;   // the row was removed before a new record of the identifier was added
-    bool replaced = false; // `changes` are all properties there are
+    bool replaced = false; // nothing stored counts any more: `whole` with `changes` are all properties there are
+    // Properties that were given as a whole, encoded: 50,000 records must not stand in memory as trees of objects.
+    std::shared_ptr<const Bytes> whole;
     std::map<std::string, Value, std::less<>> changes; // an absent value: the property is removed
     std::string location;                              // as it is with the changes
     Date touched;
 
     bool isInsertion() const { return !deleted && (!inStore || purged); }
     bool changesProperties() const { return replaced || !changes.empty(); }
-    // The stored row (or nothing) with the changes laid over it.
+    // The stored row (or nothing) with the changes laid over it: a new dictionary.
     Dictionary over(const Dictionary& stored) const;
 };
 
 // What has changed in the lists of one group. Names members and subgroups alike.
 struct PendingMembership {
-    std::vector<UniqueId> added; // in order
-    std::set<UniqueId> addedSet;
+    std::vector<UniqueId> added;                   // in order; an empty one was taken back
+    std::unordered_map<UniqueId, size_t> addedSet; // with the places
     std::set<UniqueId> removed;
     std::set<UniqueId> choicesDropped; // people whose stored choices are void
     std::map<UniqueId, std::map<std::string, std::optional<std::string>>> choices;
 
     void add(const UniqueId& member);
-    void remove(const UniqueId& member); // with the choices
-    void forget(const UniqueId& member); // the record is gone: nothing of it is left to write
-    bool empty() const { return added.empty() && removed.empty() && choicesDropped.empty() && choices.empty(); }
+    void remove(const UniqueId& member);   // with the choices
+    bool takeBack(const UniqueId& member); // what was added and is in no list yet
+    void forget(const UniqueId& member);   // the record is gone: nothing of it is left to write
+    bool empty() const { return addedSet.empty() && removed.empty() && choicesDropped.empty() && choices.empty(); }
 };
 
 // The unsaved changes of a database object. Pure bookkeeping: knows no file and no lock.
@@ -66,6 +71,9 @@ public:
     const PendingMembership* membershipIf(const UniqueId& group) const;
     const std::map<UniqueId, PendingMembership>& memberships() const { return _memberships; }
     void dropEmptyMembership(const UniqueId& group);
+    // Bytes of the properties that were given as a whole, a measure of what the changes hold in memory.
+    size_t size() const { return _size; }
+    void replace(PendingRecord& record, const Dictionary& properties);
 
     std::vector<std::pair<UniqueId, const PendingRecord*>> inOrder() const;
     const std::unordered_map<UniqueId, PendingRecord>& records() const { return _records; }
@@ -78,6 +86,7 @@ private:
     std::map<UniqueId, PendingMembership> _memberships;
     std::optional<int64_t> _shareCount;
     uint64_t _nextOrder = 1;
+    size_t _size = 0;
 };
 
 } // namespace rolvane

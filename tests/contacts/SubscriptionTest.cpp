@@ -148,5 +148,44 @@ TEST(Subscription, AStampedPayloadPutsThePersonWhereItCameFrom) {
     EXPECT_TRUE(person->isSubscribed());
 }
 
+TEST(Subscription, ItsContactsMayBeEditedOnlyWhereThePublisherGrantedWriting) {
+    TestDatabase d;
+    CXSubscriptionRef bob = CXSubscription::create(kBob, true, "Bob's people");
+    d->addRecord(bob);
+    CXPersonRef mine = d.addPerson("Mine");
+    CXPersonRef theirs = d.addSubscribedPerson("Theirs", kBob.str());
+    CXGroupRef group = CXGroup::initWithUniqueId(UniqueId("G:CXSubscribedGroup"));
+    group->setValue(TestDatabase::from(kBob.str()), kCXRemoteLocationProperty);
+    group->setValue(Value("Friends"), kCXGroupNameProperty);
+    d->addRecord(group);
+    EXPECT_TRUE(mine->isWritable());
+    EXPECT_EQ(mine->readOnlyReason(), "");
+    EXPECT_TRUE(d->allGroup()->isWritable());
+    EXPECT_TRUE(d->subscriptions()[0]->isWritable()) << "the built-in one stands for the owner's own data";
+    for (const CXRecordRef& copy : std::vector<CXRecordRef>{theirs, group, d->allGroupForRemoteLocation(kBob), bob})
+        EXPECT_FALSE(copy->isWritable()) << copy->description();
+    EXPECT_EQ(theirs->readOnlyReason(),
+              "\"Theirs\" came by the subscription to http://store.example/bob/Contacts, which may be read but not "
+              "changed. Ask its publisher for the right to write, or make a copy of your own.");
+    EXPECT_EQ(group->readOnlyReason().substr(0, 9), "\"Friends\"");
+
+    CXMutableMultiValue self;
+    self.addValue("<self>", "<self>");
+    d->allGroupForRemoteLocation(kBob)->setValue(CXMultiValue(self), kCXReadWriteSharingACLProperty);
+    for (const CXRecordRef& copy : std::vector<CXRecordRef>{theirs, group, d->allGroupForRemoteLocation(kBob), bob}) {
+        EXPECT_TRUE(copy->isWritable()) << copy->description();
+        EXPECT_EQ(copy->readOnlyReason(), "");
+    }
+}
+
+TEST(Subscription, ACopyThatIsLeftOverFromOneMayNotBeEdited) {
+    TestDatabase d;
+    CXPersonRef orphan = d.addSubscribedPerson("Orphan", kBob.str());
+    EXPECT_FALSE(orphan->isWritable()) << "nobody is there who could have granted it";
+    orphan->removeValueForProperty(kCXRemoteLocationProperty);
+    EXPECT_FALSE(orphan->isWritable());
+    EXPECT_NE(orphan->readOnlyReason().find("no subscription any more"), std::string::npos);
+}
+
 } // namespace
 } // namespace rolvane::test
