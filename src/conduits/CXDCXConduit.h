@@ -54,7 +54,8 @@ public:
     // Writes one record from another source into the database, through the handler of its type. False for composite
     // group changes, distribution-list removals and unknown types, which nothing here carries out; true for every other
     // record, what it names being gone included. Never denies. While the kill switch is on, a record of the owner's own
-    // user is logged and swallowed. But for new groups, nothing is saved before the pass ends.
+    // user is logged and swallowed. Nothing is saved before the pass ends, but for new groups and where more than 32 MB
+    // would wait.
     using CXDConduit::applyChangeRecord;
     bool applyChangeRecord(const CXDChangeRecordPtr& record, bool* denied) override;
 
@@ -122,6 +123,7 @@ private:
     Dictionary priorState() const;
     ChangeCapture newCapture() const;
     const std::string& ownProgram() const;
+    bool dispatch(const CXDChangeRecordPtr& record);
     // What the record names, where it is there, of the right kind and the record's to change; else null.
     std::shared_ptr<CXPerson> personOf(const CXDChangeRecord& record);
     std::shared_ptr<CXGroup> groupOf(const CXDChangeRecord& record);

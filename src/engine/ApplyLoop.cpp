@@ -146,8 +146,10 @@ void ApplyLoop::applyInOrder(const CXDChangeRecordPtr& record) {
     if (left) {
         record->setAppliesToSources(left);
         _pendingChanges.push_back(record);
+        record->packPayload();
+    } else {
+        record->setPayload({}); // nobody asks for it again; 50,000 contacts with photos would fill the memory
     }
-    record->packPayload();
 }
 
 bool ApplyLoop::applyTo(CXDConduit& conduit, int32_t source, const CXDChangeRecordPtr& record) {
