@@ -67,11 +67,11 @@ bool CXACLManager::save() {
 }
 
 void CXACLManager::grantPrincipal(const UserName& principal, bool allAccess) {
-    addIfAbsent(allAccess ? _allAccessPrincipals : _readAccessPrincipals, principal);
+    make({principal, allAccess, true, true});
 }
 
 void CXACLManager::denyPrincipal(const UserName& principal, bool allAccess) {
-    removeFrom(allAccess ? _allAccessPrincipals : _readAccessPrincipals, principal);
+    make({principal, allAccess, false, true});
 }
 
 void CXACLManager::grantReadPermissionForGUID(const UniqueId& guid, const std::vector<UniqueId>& members,
@@ -97,16 +97,25 @@ void CXACLManager::denyReadWritePermissionForGUID(const UniqueId& guid, const st
 // One list serves the whole base location: which group the right was asked for makes no difference.
 void CXACLManager::_grant(bool grant, const UniqueId& /*guid*/, const std::vector<UniqueId>& /*members*/,
                           const UserName& toAccount, bool readWrite) {
-    if (grant && readWrite) {
-        if (contains(_allAccessPrincipals, toAccount)) return; // the readers stay as they are, even without this one
-        _allAccessPrincipals.push_back(toAccount);
-        addIfAbsent(_readAccessPrincipals, toAccount);
-    } else if (grant) {
-        addIfAbsent(_readAccessPrincipals, toAccount);
-    } else {
-        if (!readWrite) removeFrom(_readAccessPrincipals, toAccount);
-        removeFrom(_allAccessPrincipals, toAccount); // whoever may not read may not write either
+    make({toAccount, readWrite, grant, false});
+}
+
+void CXACLManager::make(const Change& change) {
+    willChange(change);
+    carryOut(change);
+}
+
+void CXACLManager::carryOut(const Change& change) {
+    std::vector<UserName>& list = change.allAccess ? _allAccessPrincipals : _readAccessPrincipals;
+    if (change.grant) {
+        if (contains(list, change.principal)) return; // the readers stay as they are, even without this writer
+        list.push_back(change.principal);
+        if (change.allAccess && !change.oneListOnly) addIfAbsent(_readAccessPrincipals, change.principal);
+        return;
     }
+    removeFrom(list, change.principal);
+    // Whoever may not read may not write either.
+    if (!change.allAccess && !change.oneListOnly) removeFrom(_allAccessPrincipals, change.principal);
 }
 
 std::vector<Url> CXACLManager::affectedURLsForGUID(const UniqueId& guid, const std::vector<UniqueId>& members) const {

@@ -53,6 +53,16 @@ public:
 
 protected:
     virtual const char* className() const { return "CXACLManager"; }
+    // A grant or denial, as it was asked for.
+    struct Change {
+        UserName principal;
+        bool allAccess;
+        bool grant;
+        bool oneListOnly;
+    };
+    // Called for each change before it is carried out, whether it changes a list or not.
+    virtual void willChange(const Change& /*change*/) {}
+    void carryOut(const Change& change); // without calling willChange
 
     Url _baseLocation;
     bool _publisher;
@@ -60,6 +70,7 @@ protected:
     std::vector<UserName> _allAccessPrincipals;
 
 private:
+    void make(const Change& change);
     void _grant(bool grant, const UniqueId& guid, const std::vector<UniqueId>& members, const UserName& toAccount,
                 bool readWrite);
 };

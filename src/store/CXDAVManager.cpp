@@ -6,6 +6,8 @@
 #include "store/CXDAVManagerImpl.h"
 #include "store/ConfigurationValues.h"
 
+#include <strings.h>
+
 namespace rolvane {
 
 namespace {
@@ -37,6 +39,10 @@ std::string treeOf(const CXDAVAccount& account) {
     return account.user.empty() ? "\n" : account.baseLocationFor(account.user).absoluteString() + "/";
 }
 
+bool isSecure(const Url& url) {
+    return strcasecmp(url.scheme().c_str(), "https") == 0;
+}
+
 void setCode(int* code, int value) {
     if (code) *code = value;
 }
@@ -46,7 +52,8 @@ void setCode(int* code, int value) {
 CXDAVManager::Impl::Impl(CXDAVAccount account, std::shared_ptr<HttpTransport> transport, CurlTransport* signsIn,
                          std::string versionsPath)
     : versions(std::move(versionsPath)), session(std::move(account), std::move(transport), signsIn),
-      files(session, tokens, versions), structure(session, files), ownTree(treeOf(session.account())) {}
+      files(session, tokens, versions), structure(session, files), accessLists(session),
+      ownTree(treeOf(session.account())) {}
 
 CXDAVManager::CXDAVManager(CXDAVAccount account) : CXDAVManager(std::move(account), VersionsFile()) {}
 
@@ -178,13 +185,21 @@ bool CXDAVManager::sanityCheckPublishStructureCreate(bool create) {
     return !account().user.empty() && _impl->structure.check(create);
 }
 
-bool CXDAVManager::ACLsAtURL(const Url&, std::vector<std::string>&, std::vector<std::string>&) {
-    return false;
+std::optional<bool> CXDAVManager::keepsAccessLists() {
+    return _impl->accessLists.areKept();
 }
 
-bool CXDAVManager::setACLsWithReadPrincipals(const std::vector<std::string>&, const std::vector<std::string>&,
-                                             const Url&) {
-    return false;
+bool CXDAVManager::ACLsAtURL(const Url& url, std::vector<std::string>& readers, std::vector<std::string>& writers) {
+    auto found = _impl->accessLists.read(url, isSecure(url));
+    if (!found) return false;
+    readers = std::move(found->readers);
+    writers = std::move(found->writers);
+    return true;
+}
+
+bool CXDAVManager::setACLsWithReadPrincipals(const std::vector<std::string>& readers,
+                                             const std::vector<std::string>& writers, const Url& url) {
+    return _impl->accessLists.set(url, isSecure(url), {readers, writers});
 }
 
 void CXDAVManager::saveVersionMemory() {

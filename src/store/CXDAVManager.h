@@ -95,9 +95,16 @@ public:
     // True when the structure is complete afterwards.
     bool sanityCheckPublishStructureCreate(bool create);
 
-    // -- access lists (RFC 3744). This client keeps none: the first returns false and leaves the lists empty, the
-    // second returns false, and nothing is sent.
+    // -- access lists (RFC 3744), as account names: who may read, and who may write. A name with the scheme https is
+    // asked about over TLS whatever the account says. See StoreAccessLists for what else a list may hold.
+    //
+    // Whether the store keeps access lists; nothing when it did not answer. Plain WebDAV servers keep none.
+    std::optional<bool> keepsAccessLists();
+    // False, and the lists untouched, when the store keeps none there, does not show them, or gives no whole answer.
     virtual bool ACLsAtURL(const Url& url, std::vector<std::string>& readers, std::vector<std::string>& writers);
+    // True when the store has the lists. What was changed there by others since this client saw the list stays; nothing
+    // is sent when the caller changed nothing since then, or when what is there cannot be read. A name that the store
+    // does not know is logged and left out, and gives false. "<self>" and the account's own user need no entry.
     virtual bool setACLsWithReadPrincipals(const std::vector<std::string>& readers,
                                            const std::vector<std::string>& writers, const Url& url);
 

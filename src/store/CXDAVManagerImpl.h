@@ -3,6 +3,7 @@
 #include "store/CXDAVManager.h"
 #include "store/LockTokens.h"
 #include "store/PublishStructure.h"
+#include "store/StoreAccessLists.h"
 #include "store/StoreFiles.h"
 #include "store/StoreListing.h"
 #include "store/StoreSession.h"
@@ -20,6 +21,7 @@ struct CXDAVManager::Impl {
     StoreSession session;
     StoreFiles files;
     PublishStructure structure;
+    StoreAccessLists accessLists;
     const std::string ownTree; // what every name below the account's own tree begins with
 };
 

@@ -34,18 +34,24 @@ const std::shared_ptr<const std::string>& propfindBody() {
 
 } // namespace
 
-bool announcesDav1(const HttpResponse& answer) {
+bool announcesDavClass(const HttpResponse& answer, std::string_view wanted) {
     for (const auto& [name, value] : answer.headers) {
         if (name != "dav") continue;
-        size_t at = 0;
-        while (at <= value.size()) {
+        for (size_t at = 0; at <= value.size();) {
             const size_t comma = std::min(value.find(',', at), value.size());
             const size_t first = value.find_first_not_of(" \t", at);
-            if (first < comma && value[first] == '1' && value.find_first_not_of(" \t", first + 1) >= comma) return true;
+            if (first < comma) {
+                const std::string_view rest = std::string_view(value).substr(first, comma - first);
+                if (rest.substr(0, rest.find_last_not_of(" \t") + 1) == wanted) return true;
+            }
             at = comma + 1;
         }
     }
     return false;
+}
+
+bool announcesDav1(const HttpResponse& answer) {
+    return announcesDavClass(answer, "1");
 }
 
 std::unique_ptr<CurlTransport> makeAccountTransport(const CXDAVAccount& account) {

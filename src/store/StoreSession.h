@@ -10,6 +10,7 @@
 #include <mutex>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 namespace rolvane {
@@ -62,7 +63,9 @@ private:
     std::atomic<int64_t> _davSeen{0}; // steady milliseconds when the server last proved to be a WebDAV server; 0: never
 };
 
-// "DAV: 1, 2" -> true (RFC 4918 section 10.1)
+// Whether the answer's "DAV" headers name the compliance class (RFC 4918 section 10.1).
+bool announcesDavClass(const HttpResponse& answer, std::string_view name);
+// "DAV: 1, 2" -> true
 bool announcesDav1(const HttpResponse& answer);
 
 // The transport for an account over libcurl, without credentials yet.

@@ -1,0 +1,69 @@
+#pragma once
+
+#include "acl/CXACLManager.h"
+#include "store/CXACE.h"
+
+#include <map>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace rolvane {
+
+class CXDAVManager;
+class CXDAVNode;
+
+// The access list of a base location on the network store. The owner's own list is read and set there. Of a location
+// that somebody else published, the server is asked what the current user may do: the lists then hold "<self>" or
+// nobody. One thread at a time; operations wait for the server.
+//
+// What the owner grants or denies while the list could not be read is kept and carried out on what the next `save`
+// reads: a list that was never seen is not replaced.
+class CXDAVACLManager final : public CXACLManager {
+public:
+    // The namespace of the store's own elements.
+    static constexpr const char* kStoreNamespace = "http://rolvane.net/ns/";
+
+    // Loads; whether that worked is asked with `loaded`. The client is borrowed and outlives the manager.
+    CXDAVACLManager(Url baseLocation, const LocationOwner& owner, CXDAVManager& manager);
+
+    bool load() override; // false: nothing could be read, and the lists are as they were
+    // True without a request for somebody else's location; else whether the list is on the store.
+    bool save() override;
+    bool loaded() const { return _loaded; }
+
+    bool publisherLoad();
+    bool subscriberLoad();
+    // Asks which resources of the tree have access lists of their own; nothing of the answer is kept. True when there
+    // was one.
+    bool publisherLoadResourceSet();
+    bool saveSimpleACL();
+
+    // What the two queries ask.
+    static std::string currentUserPrivilegesBody();
+    static std::string resourceSetBody();
+
+    // What the answers say, without a server. Nothing when the answer is not one multistatus with a response.
+    struct CurrentUserRights {
+        bool mayWrite = false;
+    };
+    static std::optional<CurrentUserRights> rightsIn(const CXDAVNode& root);
+    struct Resource {
+        std::vector<Url> members;
+        std::vector<CXACE> entries;
+    };
+    static std::optional<std::map<std::string, Resource>> resourcesIn(const CXDAVNode& root, const Url& base);
+
+protected:
+    const char* className() const override { return "CXDAVACLManager"; }
+    void willChange(const Change& change) override;
+
+private:
+    std::optional<CXDAVNode> ask(const Url& target, std::string body);
+
+    CXDAVManager& _manager;
+    bool _loaded = false;
+    std::vector<Change> _unseen; // what was asked for while the list on the store was not known
+};
+
+} // namespace rolvane

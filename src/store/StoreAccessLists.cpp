@@ -1,0 +1,204 @@
+#include "store/StoreAccessLists.h"
+
+#include "foundation/Log.h"
+#include "store/StorePrincipals.h"
+
+#include <algorithm>
+#include <memory>
+
+namespace rolvane {
+namespace {
+
+constexpr const char* kBody = "<?xml version=\"1.0\" encoding=\"utf-8\" ?><D:propfind xmlns:D=\"DAV:\"><D:prop>"
+                              "<D:acl/><D:owner/><D:principal-collection-set/></D:prop></D:propfind>";
+
+bool contains(const std::vector<std::string>& list, const std::string& name) {
+    return std::find(list.begin(), list.end(), name) != list.end();
+}
+
+void addIfAbsent(std::vector<std::string>& list, const std::string& name) {
+    if (!contains(list, name)) list.push_back(name);
+}
+
+// `theirs` with what the caller added to and took from `known`.
+std::vector<std::string> merged(const std::vector<std::string>& theirs, const std::vector<std::string>& known,
+                                const std::vector<std::string>& wanted) {
+    std::vector<std::string> all;
+    for (const std::string& name : theirs)
+        if (!contains(known, name) || contains(wanted, name)) addIfAbsent(all, name);
+    for (const std::string& name : wanted)
+        if (!contains(known, name)) addIfAbsent(all, name);
+    return all;
+}
+
+bool sameNames(std::vector<std::string> a, std::vector<std::string> b) {
+    std::sort(a.begin(), a.end());
+    std::sort(b.begin(), b.end());
+    return a == b;
+}
+
+// One list belongs to a name whichever scheme it is asked about with.
+std::string keyOf(const Url& name) {
+    return name.absoluteString().substr(name.scheme().size());
+}
+
+std::vector<std::string> hrefsIn(const CXDAVNode* property) {
+    std::vector<std::string> hrefs;
+    if (property)
+        for (const CXDAVNode* href : property->childNodesMatchingString("href")) hrefs.push_back(href->content());
+    return hrefs;
+}
+
+std::string grantTo(const std::string& href, bool read, bool write) {
+    std::string ace = "<D:ace><D:principal><D:href>" + CXDAVNode::escaped(href) + "</D:href></D:principal><D:grant>";
+    if (read) ace += "<D:privilege><D:read/></D:privilege>";
+    if (write) ace += "<D:privilege><D:write/></D:privilege>";
+    return ace + "</D:grant></D:ace>";
+}
+
+// The precondition that the server names (RFC 3744 section 8.1.1), for the log.
+std::string reasonIn(const HttpResponse& answer) {
+    const auto root = parseDAVTree(answer.body);
+    const CXDAVNode* error = root ? root->childAtIndex(0).firstChild("error") : nullptr;
+    return error && error->childCount() != 0 && !error->childAtIndex(0).isText() ? error->childAtIndex(0).string()
+                                                                                 : std::string("no reason given");
+}
+
+} // namespace
+
+// The list at one place, as the store has it.
+struct StoreAccessLists::OnStore {
+    Url asked;
+    std::vector<CXACE> entries; // without the server's own and those of other resources
+    std::string owner;          // the owner's principal, "" when the store does not say
+    std::shared_ptr<StorePrincipals> principals;
+};
+
+std::optional<bool> StoreAccessLists::areKept() {
+    const auto base = _session.endpoint(_session.account().baseLocationFor(_session.account().user));
+    if (!base) return std::nullopt;
+    const HttpResponse answer = _session.send(StoreSession::request("OPTIONS", *base));
+    if (!answer.complete() || !announcesDav1(answer)) return std::nullopt;
+    return announcesDavClass(answer, "access-control");
+}
+
+std::optional<StoreAccessLists::OnStore> StoreAccessLists::fetch(const Url& name, bool securely) {
+    const auto target = _session.endpoint(name, securely);
+    if (!target) return std::nullopt;
+    HttpRequest request = StoreSession::propfind(*target, 0);
+    request.body = std::make_shared<const std::string>(kBody);
+    request.limits.maxBodyBytes = 8u << 20;
+    const HttpResponse answer = _session.send(std::move(request));
+    const auto root = answer.complete() && answer.status == 207 ? parseDAVTree(answer.body) : std::nullopt;
+    const auto responses = root ? davResponses(*root) : std::nullopt;
+    if (!responses || responses->size() != 1) return std::nullopt;
+    const CXDAVNode& response = *responses->front();
+    const CXDAVNode* list = davProperty(response, "acl");
+    if (!list) return std::nullopt;
+
+    OnStore found;
+    found.asked = *target;
+    found.principals = std::make_shared<StorePrincipals>(_session, *target,
+                                                         hrefsIn(davProperty(response, "principal-collection-set")));
+    const auto owners = hrefsIn(davProperty(response, "owner"));
+    if (!owners.empty()) found.owner = owners.front();
+    for (const CXDAVNode* node : list->childNodesMatchingString("ace")) {
+        const auto ace = CXACE::initWithACENode(*node);
+        if (!ace) return std::nullopt; // to set the list without an entry that is not understood would take it away
+        if (ace->isProtected() || ace->isInherited()) continue;
+        if (ace->principal() == CXACE::Principal::href) found.principals->learn(ace->href());
+        found.entries.push_back(*ace);
+    }
+    return found;
+}
+
+bool StoreAccessLists::isOurs(const OnStore& found, const CXACE& ace) const {
+    if (!ace.isGrant() || ace.isInverted() || ace.principal() != CXACE::Principal::href || !ace.isPlain()) return false;
+    const std::string name = found.principals->nameFor(ace.href());
+    return !name.empty() && ace.href() != found.owner && name != found.principals->nameFor(found.owner) &&
+           name != _session.account().user.str();
+}
+
+AccessLists StoreAccessLists::listsOf(const OnStore& found) const {
+    AccessLists lists;
+    for (const CXACE& ace : found.entries) {
+        if (!isOurs(found, ace)) continue;
+        const std::string name = found.principals->nameFor(ace.href());
+        if (ace.canRead()) addIfAbsent(lists.readers, name);
+        if (ace.canWrite()) addIfAbsent(lists.writers, name);
+    }
+    return lists;
+}
+
+std::optional<AccessLists> StoreAccessLists::read(const Url& name, bool securely) {
+    const auto found = fetch(name, securely);
+    if (!found) return std::nullopt;
+    AccessLists lists = listsOf(*found);
+    const std::lock_guard guard(_mutex);
+    return _known[keyOf(name)] = std::move(lists);
+}
+
+// Takes out whom the store does not know; false when there was somebody.
+bool StoreAccessLists::dropUnknown(const Url& name, OnStore& found, std::vector<std::string>& list) {
+    return 0 == std::erase_if(list, [&](const std::string& who) {
+               if (found.principals->hrefFor(who)) return false;
+               CXLog("The store knows nobody called \"%@\": the access list of %@ goes without.", who, name);
+               return true;
+           });
+}
+
+bool StoreAccessLists::send(const Url& name, bool securely, OnStore& found, const AccessLists& wanted) {
+    std::string body = "<?xml version=\"1.0\" encoding=\"utf-8\" ?><D:acl xmlns:D=\"DAV:\">";
+    for (const CXACE& ace : found.entries)
+        if (!isOurs(found, ace)) body += ace.xml();
+    std::vector<std::string> names = wanted.readers;
+    for (const std::string& writer : wanted.writers) addIfAbsent(names, writer);
+    for (const std::string& who : names)
+        body += grantTo(found.principals->hrefFor(who).value_or(std::string()), contains(wanted.readers, who),
+                        contains(wanted.writers, who));
+    body += "</D:acl>";
+
+    const auto target = _session.endpoint(name, securely);
+    if (!target) return false;
+    HttpRequest request = StoreSession::request("ACL", *target);
+    request.headers = {{"Content-Type", "application/xml; charset=utf-8"}};
+    request.body = std::make_shared<const std::string>(std::move(body));
+    const HttpResponse answer = _session.send(std::move(request));
+    if (answer.ok()) return true;
+    CXLog("The access list of %@ could not be set: %@", name,
+          answer.complete() ? std::to_string(answer.status) + ", " + reasonIn(answer) : answer.detail);
+    return false;
+}
+
+bool StoreAccessLists::set(const Url& name, bool securely, const AccessLists& asked) {
+    const std::string key = keyOf(name);
+    AccessLists wanted = asked;
+    // The owner needs no entry: the store has its own for that.
+    for (auto* list : {&wanted.readers, &wanted.writers})
+        std::erase_if(*list, [this](const std::string& who) {
+            return who == kSelf.str() || who == _session.account().user.str();
+        });
+    std::optional<AccessLists> known;
+    {
+        const std::lock_guard guard(_mutex);
+        if (const auto seen = _known.find(key); seen != _known.end()) known = seen->second;
+    }
+    if (known == wanted) return true;
+    auto found = fetch(name, securely);
+    if (!found) return false;
+    const AccessLists theirs = listsOf(*found);
+    AccessLists next = wanted;
+    if (known)
+        next = {merged(theirs.readers, known->readers, wanted.readers),
+                merged(theirs.writers, known->writers, wanted.writers)};
+    const bool readersKnown = dropUnknown(name, *found, next.readers);
+    const bool complete = dropUnknown(name, *found, next.writers) && readersKnown;
+    const bool isThere = sameNames(next.readers, theirs.readers) && sameNames(next.writers, theirs.writers);
+    if (!isThere && !send(name, securely, *found, next)) return false;
+    if (!complete) return false;
+    const std::lock_guard guard(_mutex);
+    _known[key] = std::move(wanted);
+    return true;
+}
+
+} // namespace rolvane
