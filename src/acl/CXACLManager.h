@@ -27,6 +27,8 @@ public:
     virtual bool load();     // base: false, nothing loaded
     virtual bool validate(); // base: true
     virtual bool save();     // base: what validate says
+    // Whether the lists say what is kept, so that they may be compared; base: true.
+    virtual bool isKnown() const { return true; }
 
     const Url& baseLocation() const { return _baseLocation; }
     bool publisher() const { return _publisher; }

@@ -24,13 +24,14 @@ public:
     // The namespace of the store's own elements.
     static constexpr const char* kStoreNamespace = "http://rolvane.net/ns/";
 
-    // Loads; whether that worked is asked with `loaded`. The client is borrowed and outlives the manager.
+    // Loads. The client is borrowed and outlives the manager.
     CXDAVACLManager(Url baseLocation, const LocationOwner& owner, CXDAVManager& manager);
 
     bool load() override; // false: nothing could be read, and the lists are as they were
     // True without a request for somebody else's location; else whether the list is on the store.
     bool save() override;
-    bool loaded() const { return _loaded; }
+    // False: the owner's list could not be read yet. What cannot be read of somebody else's location is no access.
+    bool isKnown() const override { return _loaded || !_publisher; }
 
     bool publisherLoad();
     bool subscriberLoad();

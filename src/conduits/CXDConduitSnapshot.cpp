@@ -213,7 +213,7 @@ Dictionary CXDConduit::comparePriorDistributionListToCurrentDistributionList(con
 CXDChangeRecords CXDConduit::changeRecordsForACLAtRemoteLocation(const Url& location) {
     CXDChangeRecords records;
     const auto manager = keepsAccessLists() ? ACLManagerForRemoteLocation(location) : nullptr;
-    if (!manager) return records;
+    if (!manager || !manager->isKnown()) return records;
     const UserName user = _engine.userForRemoteLocation(RemoteLocation(location.absoluteString()));
     const Dictionary users = _engine.conduitObjectForKey(kConduitCX, kPriorState);
     const Dictionary prior = users[user.str()].dictionary()[layout::kAllGroup].dictionary();

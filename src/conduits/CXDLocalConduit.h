@@ -31,6 +31,7 @@ public:
 
     // References are borrowed and outlive the conduit.
     struct World {
+        CXRolvane& rolvane;
         Preferences& preferences;
         Clock& clock;
         UserName login;           // of the process's user
@@ -60,6 +61,11 @@ public:
     // Marks that the record's user publishes all contacts. No change type leads here. False only for a user whose name
     // is no name of a directory.
     bool publishAllGroup(const CXDChangeRecord& record);
+
+protected:
+    CXRolvane& database() const override { return _world.rolvane; }
+    Preferences& preferences() const override { return _world.preferences; }
+    bool keepsAccessLists() const override { return false; }
 
 private:
     // The path below the directory of the record's user; nothing when a name on the way is no name of a file.

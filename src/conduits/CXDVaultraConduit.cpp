@@ -1,5 +1,6 @@
 #include "conduits/CXDVaultraConduit.h"
 
+#include "acl/CXDAVACLManager.h"
 #include "conduits/LocalizedText.h"
 #include "conduits/PublishedLayout.h"
 #include "conduits/UserAlert.h"
@@ -46,10 +47,6 @@ std::vector<UniqueId> knownMembers(ConduitEngine& engine, const std::optional<Us
 }
 
 } // namespace
-
-std::shared_ptr<CXACLManager> makePlainACLManager(const Url& baseLocation, const LocationOwner& owner) {
-    return std::make_shared<CXACLManager>(baseLocation, owner);
-}
 
 CXDVaultraConduit::CXDVaultraConduit(ConduitEngine& engine, World world)
     : CXDConduit(engine), _world(std::move(world)) {
@@ -113,7 +110,9 @@ void CXDVaultraConduit::open() {
         engine().cancel();
     }
     _lastSyncDate = _world.preferences.get(kDaemonDomain, kLastSyncDateKey).date().value_or(Date::distantPast());
-    if (!_vaultraOffLine) sanityCheckPublishStructure();
+    if (_vaultraOffLine) return;
+    forgetSubscribersRights();
+    sanityCheckPublishStructure();
 }
 
 void CXDVaultraConduit::close() {
@@ -282,11 +281,25 @@ bool CXDVaultraConduit::changeGroupReadWriteACL(CXDChangeRecord& record) {
     return true;
 }
 
+bool CXDVaultraConduit::keepsAccessLists() const {
+    return _world.manager.keepsAccessLists().value_or(false);
+}
+
+// What somebody else lets us do may have changed since it was asked; nothing of ours is lost with the answer.
+void CXDVaultraConduit::forgetSubscribersRights() {
+    if (_ACLManagerMap && keepsAccessLists())
+        std::erase_if(*_ACLManagerMap, [](const auto& entry) { return !entry.second->publisher(); });
+}
+
 std::shared_ptr<CXACLManager> CXDVaultraConduit::ACLManagerForRemoteLocation(const Url& location) {
     if (auto known = CXDConduit::ACLManagerForRemoteLocation(location)) return known;
     const auto base = baseLocationForRemoteLocation(location);
     if (!base) return nullptr;
-    auto manager = _world.makeACLManager(*base, engine());
+    std::shared_ptr<CXACLManager> manager;
+    if (_world.makeACLManager)
+        manager = _world.makeACLManager(*base, engine());
+    else
+        manager = std::make_shared<CXDAVACLManager>(*base, engine(), _world.manager);
     _ACLManagerMap->insert_or_assign(base->absoluteString(), manager);
     return manager;
 }

@@ -19,12 +19,9 @@ class Clock;
 class Preferences;
 class UserAlert;
 
-// Makes the access-list manager of a base location. Exists so that the store that keeps the lists can be replaced.
+// Makes the access-list manager of a base location. Exists so that tests can replace it.
 using ACLManagerFactory =
     std::function<std::shared_ptr<CXACLManager>(const Url& baseLocation, const LocationOwner& owner)>;
-
-// A manager that keeps its lists in memory only: nothing is loaded from or saved to any store.
-std::shared_ptr<CXACLManager> makePlainACLManager(const Url& baseLocation, const LocationOwner& owner);
 
 // The conduit of the network store: applies change records to the tree of the record's user on the WebDAV store, and
 // knows whether the store can be used at all.
@@ -48,8 +45,7 @@ public:
         DistributedNotifications& distributed; // the user's processes': "SimulateVaultraNotification"
         UserAlert& alert;
         CXRolvane& rolvane;
-        ACLManagerFactory makeACLManager = makePlainACLManager;
-        bool storeKeepsAccessLists = false; // false: nobody else can have changed what the managers say
+        ACLManagerFactory makeACLManager = {}; // none: a CXDAVACLManager on the client
     };
 
     CXDVaultraConduit(ConduitEngine& engine, World world);
@@ -90,9 +86,10 @@ public:
 protected:
     CXRolvane& database() const override { return _world.rolvane; }
     Preferences& preferences() const override { return _world.preferences; }
-    bool keepsAccessLists() const override { return _world.storeKeepsAccessLists; }
+    bool keepsAccessLists() const override; // as the server announces it
 
 private:
+    void forgetSubscribersRights();
     int testReachability(); // sets _vaultraOffLine; the error's code, 0 when there was none
     std::optional<Url> baseLocationOf(const CXDChangeRecord& record) const;
 

@@ -122,10 +122,9 @@ private:
 
     EngineConduits makeConduits(ConduitEngine& engine, CXDAVManager& store) {
         auto vaultra = std::make_unique<CXDVaultraConduit>(
-            engine,
-            CXDVaultraConduit::World{store, CXNetworkController::sharedNetworkController(), Preferences::shared(),
-                                     Clock::system(), NotificationCenter::defaultCenter(), *_bus, _alert,
-                                     CXRolvane::sharedLocalRolvane(), makePlainACLManager});
+            engine, CXDVaultraConduit::World{
+                        store, CXNetworkController::sharedNetworkController(), Preferences::shared(), Clock::system(),
+                        NotificationCenter::defaultCenter(), *_bus, _alert, CXRolvane::sharedLocalRolvane()});
         auto cx = std::make_unique<CXDCXConduit>(engine, CXDCXConduit::World{CXRolvane::sharedLocalRolvane(),
                                                                              Preferences::shared(), Clock::system(),
                                                                              NotificationCenter::defaultCenter()});

@@ -186,7 +186,7 @@ bool CXDAVManager::sanityCheckPublishStructureCreate(bool create) {
 }
 
 std::optional<bool> CXDAVManager::keepsAccessLists() {
-    return _impl->accessLists.areKept();
+    return _impl->session.keepsAccessLists();
 }
 
 bool CXDAVManager::ACLsAtURL(const Url& url, std::vector<std::string>& readers, std::vector<std::string>& writers) {

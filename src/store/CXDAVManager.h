@@ -98,7 +98,8 @@ public:
     // -- access lists (RFC 3744), as account names: who may read, and who may write. A name with the scheme https is
     // asked about over TLS whatever the account says. See StoreAccessLists for what else a list may hold.
     //
-    // Whether the store keeps access lists; nothing when it did not answer. Plain WebDAV servers keep none.
+    // Whether the store keeps access lists, as it last said; nothing when it does not answer. Plain WebDAV servers keep
+    // none.
     std::optional<bool> keepsAccessLists();
     // False, and the lists untouched, when the store keeps none there, does not show them, or gives no whole answer.
     virtual bool ACLsAtURL(const Url& url, std::vector<std::string>& readers, std::vector<std::string>& writers);

@@ -74,17 +74,9 @@ struct StoreAccessLists::OnStore {
     std::shared_ptr<StorePrincipals> principals;
 };
 
-std::optional<bool> StoreAccessLists::areKept() {
-    const auto base = _session.endpoint(_session.account().baseLocationFor(_session.account().user));
-    if (!base) return std::nullopt;
-    const HttpResponse answer = _session.send(StoreSession::request("OPTIONS", *base));
-    if (!answer.complete() || !announcesDav1(answer)) return std::nullopt;
-    return announcesDavClass(answer, "access-control");
-}
-
 std::optional<StoreAccessLists::OnStore> StoreAccessLists::fetch(const Url& name, bool securely) {
     const auto target = _session.endpoint(name, securely);
-    if (!target) return std::nullopt;
+    if (!target || _session.keepsAccessLists() == false) return std::nullopt;
     HttpRequest request = StoreSession::propfind(*target, 0);
     request.body = std::make_shared<const std::string>(kBody);
     request.limits.maxBodyBytes = 8u << 20;

@@ -32,8 +32,6 @@ class StoreAccessLists {
 public:
     explicit StoreAccessLists(StoreSession& session) : _session(session) {}
 
-    // Whether the store keeps access lists at all (RFC 3744 section 7.2); nothing when it did not answer.
-    std::optional<bool> areKept();
     // Nothing when the store keeps none there, does not show them, or gives no whole answer.
     std::optional<AccessLists> read(const Url& name, bool securely);
     // True when the list holds what was asked for, but for names that the store does not know: those are logged, the

@@ -157,11 +157,19 @@ HttpResponse StoreSession::options() {
     HttpRequest r = request("OPTIONS", *base);
     r.limits = {20, 10, 1u << 20, 64u << 10};
     HttpResponse answer = _transport->perform(std::move(r));
-    if (answer.complete() && (answer.ok() || answer.status == 403 || answer.status == 404) && announcesDav1(answer))
+    if (answer.complete() && (answer.ok() || answer.status == 403 || answer.status == 404) && announcesDav1(answer)) {
         _davSeen = steadyMilliseconds();
-    else if (answer.status != 401)
+        _accessLists = announcesDavClass(answer, "access-control") ? 1 : 0;
+    } else if (answer.status != 401) {
         _davSeen = 0;
+    }
     return answer;
+}
+
+std::optional<bool> StoreSession::keepsAccessLists() {
+    if (_accessLists < 0 && signIn()) options();
+    const int kept = _accessLists;
+    return kept < 0 ? std::nullopt : std::optional(kept == 1);
 }
 
 bool StoreSession::isDavServer() {

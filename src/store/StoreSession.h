@@ -37,6 +37,9 @@ public:
 
     // Whether the store can be used, see CXDAVManager::canReachOstrelError.
     bool canReach(CXDAVError& error);
+    // Whether the server announces access lists (RFC 3744 section 7.2), as it last said; asked when it never did.
+    // Nothing when it does not answer.
+    std::optional<bool> keepsAccessLists();
     // The password; absent, and the failed-password handler called, when it cannot be had.
     std::optional<std::string> password();
 
@@ -60,6 +63,7 @@ private:
     bool _loginRefused = false; // a 401 was seen: ask for the password anew
     bool _loginProven = false;  // a request that needs a login has succeeded
     std::atomic<bool> _signedIn{false};
+    std::atomic<int> _accessLists{-1}; // 1 or 0 as the server announced it last, -1: it never answered
     std::atomic<int64_t> _davSeen{0}; // steady milliseconds when the server last proved to be a WebDAV server; 0: never
 };
 

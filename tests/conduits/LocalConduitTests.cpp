@@ -1,6 +1,7 @@
 #include "conduits/CXDLocalConduit.h"
 
 #include "FakeEngine.h"
+#include "contacts/CXRolvane.h"
 #include "contacts/Constants.h"
 #include "foundation/Paths.h"
 #include "foundation/Preferences.h"
@@ -27,9 +28,17 @@ protected:
         fs::create_directory(root);
         conduit = make();
     }
+    CXRolvane::Options databaseOptions() {
+        CXRolvane::Options options;
+        options.path = directory / "contacts.db";
+        options.program = "RolvaneManager";
+        options.clock = &clock;
+        options.center = &center;
+        return options;
+    }
     std::unique_ptr<CXDLocalConduit> make() {
-        return std::make_unique<CXDLocalConduit>(engine,
-                                                 CXDLocalConduit::World{preferences, clock, UserName("ada"), root});
+        return std::make_unique<CXDLocalConduit>(
+            engine, CXDLocalConduit::World{database, preferences, clock, UserName("ada"), root});
     }
     static CXDChangeRecordPtr record(int type, const char* person, const char* group, Value payload = {},
                                      const char* user = "<self>") {
@@ -62,6 +71,8 @@ protected:
     FakeEngine engine;
     ManualClock clock{Date(1'800'000'000)};
     Preferences preferences{directory / "preferences.db"};
+    NotificationCenter center;
+    CXRolvane database{databaseOptions()};
     CapturingLog log;
     std::unique_ptr<CXDLocalConduit> conduit;
 };
@@ -79,10 +90,10 @@ TEST_F(LocalConduit, IsTheSharedFoldersSource) {
 }
 
 TEST_F(LocalConduit, IsMeantForTheFolderThatAllUsersShare) {
-    const CXDLocalConduit usual(engine, CXDLocalConduit::World{preferences, clock, UserName("ada")});
+    const CXDLocalConduit usual(engine, CXDLocalConduit::World{database, preferences, clock, UserName("ada")});
     EXPECT_EQ(usual.lockPath(), "/usr/share/rolvane/.lock");
     EXPECT_EQ(usual.baseLocationForUser(UserName("bob"))->absoluteString(), "file:/usr/share/rolvane/bob");
-    const CXDLocalConduit another(engine, CXDLocalConduit::World{preferences, clock, UserName("eve")});
+    const CXDLocalConduit another(engine, CXDLocalConduit::World{database, preferences, clock, UserName("eve")});
     EXPECT_EQ(usual.defaultManager(), another.defaultManager()) << "one file manager serves the process";
     EXPECT_EQ(conduit->lockPath(), root + "/.lock");
 }

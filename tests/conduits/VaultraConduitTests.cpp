@@ -61,7 +61,7 @@ protected:
         CXDVaultraConduit::World parts{client->manager, network,     preferences, clock,
                                        center,          distributed, alert,       database};
         parts.makeACLManager = [this](const Url& base, const LocationOwner& owner) {
-            auto manager = makePlainACLManager(base, owner);
+            auto manager = std::make_shared<CXACLManager>(base, owner);
             managers.push_back(manager);
             return manager;
         };

@@ -26,7 +26,8 @@ protected:
         parts.makeLock = [&whose](const Url& url) { return makeFileLock(url, whose.clock); };
         whose.engine = std::make_unique<CXDSyncEngine>(parts);
         return std::make_unique<CXDLocalConduit>(
-            *whose.engine, CXDLocalConduit::World{whose.preferences, whose.clock, UserName(login), folder});
+            *whose.engine,
+            CXDLocalConduit::World{*whose.rolvane, whose.preferences, whose.clock, UserName(login), folder});
     }
     bool isEmpty() const { return fs::is_empty(folder); }
 
