@@ -10,6 +10,17 @@ namespace {
 void silent(void*, const char*, ...) {}
 void silentStructured(void*, xmlErrorPtr) {}
 
+// libxml2 hands an ampersand in the value of an attribute over as "&#38;".
+std::string plainURI(std::string_view uri) {
+    constexpr std::string_view kAmpersand = "&#38;";
+    std::string out;
+    for (size_t at = 0; at < uri.size();) {
+        out += uri[at];
+        at += uri.substr(at).starts_with(kAmpersand) ? kAmpersand.size() : 1;
+    }
+    return out;
+}
+
 } // namespace
 
 XmlSax::XmlSax(int maxDepth) : _maxDepth(static_cast<size_t>(maxDepth)) {
@@ -56,7 +67,7 @@ void XmlSax::onStart(void* self, const xmlChar* local, const xmlChar*, const xml
     if (!sax->_good) return;
     const std::string_view space = uri ? reinterpret_cast<const char*>(uri) : "";
     std::string name = reinterpret_cast<const char*>(local);
-    if (space != "DAV:") name = "{" + std::string(space) + "}" + name;
+    if (space != "DAV:") name = "{" + plainURI(space) + "}" + name;
     sax->_path.push_back(std::move(name));
     if (sax->_path.size() > sax->_maxDepth || !sax->opened(sax->_path)) sax->refuse();
 }
