@@ -6,6 +6,7 @@
 #include "store/CXDAVManagerImpl.h"
 #include "store/ConfigurationValues.h"
 
+#include <cstdlib>
 #include <strings.h>
 
 namespace rolvane {
@@ -81,8 +82,11 @@ HttpTransport& CXDAVManager::transport() {
 
 static std::shared_ptr<CXDAVManager> shared() {
     std::lock_guard guard(sharedMutex);
-    if (!sharedManager)
+    if (!sharedManager) {
         sharedManager = std::make_shared<CXDAVManager>(savedAccount(), CXDAVManager::VersionsFile{versionMemoryPath()});
+        // Now, when the TLS library has put its own end in the list: connections have to be closed before it goes.
+        [[maybe_unused]] static const int once = std::atexit([] { CXDAVManager::setDefaultManager(nullptr); });
+    }
     return sharedManager;
 }
 
