@@ -17,7 +17,7 @@ constexpr double kTerminationGlance = 0.2; // how often a wait without workers l
 } // namespace
 
 OutOfOrderWork::OutOfOrderWork(EngineParts& parts, CXDChangeRecords records)
-    : _parts(parts), _outOfOrderLock(records.empty() ? 1 : 0),
+    : _parts(parts), _turns(records), _outOfOrderLock(records.empty() ? 1 : 0),
       _records(std::make_move_iterator(records.begin()), std::make_move_iterator(records.end())),
       _changeCount(_records.size()) {}
 
@@ -82,6 +82,7 @@ void OutOfOrderWork::outOfOrderWorkLoop() {
         const bool last = _records.empty();
         _outOfOrderLock.unlockWithCondition(0);
 
+        _turns.await(*record);
         const int32_t wanted = record->appliesToSources();
         const int32_t applied = _parts.terminating ? 0 : apply(record, denied);
         if (applied != wanted || record.use_count() > 1) record->packPayload(); // somebody keeps it
@@ -91,6 +92,7 @@ void OutOfOrderWork::outOfOrderWorkLoop() {
             const std::lock_guard guard(_processedChangesLock);
             _pending.push_back(record);
         }
+        _turns.done(*record);
         report(record);
         if (last && std::this_thread::get_id() == _parts.mainThread) return; // it must not wait for more
     }

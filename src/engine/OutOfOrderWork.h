@@ -1,6 +1,7 @@
 #pragma once
 
 #include "engine/EngineParts.h"
+#include "engine/RecordTurns.h"
 #include "foundation/ConditionLock.h"
 #include "model/CXDChangeRecord.h"
 
@@ -13,8 +14,9 @@
 namespace rolvane {
 
 // The records of one pass that may be applied in any order, and the workers that apply them while the main thread
-// waits. A worker takes the record at the front, applies it to the sources that it asks for, and reports it. A record
-// with sources left over goes to the pending ones. Built, waited for and finished on the main thread.
+// waits. A worker takes the record at the front, waits while another is at work on the same group or person, applies it
+// to the sources that it asks for, and reports it. A record with sources left over goes to the pending ones. Built,
+// waited for and finished on the main thread.
 //
 // Condition of the lock: 0 while records are to hand out or in work, 1 when every record has been handled.
 class OutOfOrderWork {
@@ -44,6 +46,7 @@ private:
     void report(const CXDChangeRecordPtr& record);
 
     EngineParts& _parts;
+    RecordTurns _turns;
     ConditionLock _outOfOrderLock;
     std::deque<CXDChangeRecordPtr> _records;      // guarded by _outOfOrderLock
     std::unordered_set<UserName> _cancelledUsers; // guarded by _outOfOrderLock

@@ -119,10 +119,20 @@ public:
     std::optional<RemoteLocation> remoteLocation(const RecordLocator& locator) const;
 
 private:
+    // A worker sets its own record's while others compare with it.
+    struct Mask : std::atomic<int32_t> {
+        using std::atomic<int32_t>::atomic;
+        using std::atomic<int32_t>::operator=;
+        Mask(const Mask& other) : std::atomic<int32_t>(other.load()) {}
+        Mask& operator=(const Mask& other) {
+            store(other.load());
+            return *this;
+        }
+    };
     struct Payload; // shared by copies: the value, or its encoded form until it is first read
     int32_t _changeType = 0;
     int32_t _initialSource = 0;
-    std::atomic<int32_t> _appliesToSources = 0; // a worker sets its own record's while others compare with it
+    Mask _appliesToSources{0};
     int32_t _appliedToSources = 0;
     std::optional<UniqueId> _puid;
     std::optional<UniqueId> _guid;

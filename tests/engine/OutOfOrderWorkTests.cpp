@@ -7,6 +7,7 @@
 
 #include <algorithm>
 #include <future>
+#include <map>
 #include <gtest/gtest.h>
 
 namespace rolvane {
@@ -130,6 +131,51 @@ TEST_F(Workers, TakeTheRecordsFromTheFront) {
     world.account.threads = 1;
     world.engine->applyChangeRecords(updates(5));
     EXPECT_EQ(world.vaultra->applied(), (Strings{"P0", "P1", "P2", "P3", "P4"}));
+}
+
+TEST_F(Workers, ApplyTheRecordsOfOneGroupInTheOrderOfTheListAndNeverSideBySide) {
+    EngineParts parts(world.collaborators());
+    parts.conduits = parts.with.makeConduits(*world.engine);
+    std::mutex lock;
+    std::map<std::string, int> inside;
+    std::map<std::string, Strings> order;
+    bool sideBySide = false;
+    world.vaultra->whenApplying = [&](const CXDChangeRecordPtr& record, bool*) {
+        const std::string group = record->group()->str();
+        {
+            const std::lock_guard guard(lock);
+            sideBySide |= ++inside[group] > 1;
+        }
+        std::this_thread::yield();
+        const std::lock_guard guard(lock);
+        --inside[group];
+        order[group].push_back(record->person()->str());
+        return true;
+    };
+    CXDChangeRecords records;
+    std::map<std::string, Strings> expected;
+    for (int i = 0; i < 300; ++i) {
+        const std::string person = "P" + std::to_string(1000 + i), group = "G" + std::to_string(i % 3);
+        records.push_back(makeRecord(CXDAddGroupToGroup, person.c_str(), group.c_str()));
+        expected[group].push_back(person);
+    }
+    OutOfOrderWork work(parts, records);
+    work.start(10);
+    work.wait();
+    work.finish();
+    EXPECT_FALSE(sideBySide);
+    EXPECT_EQ(order, expected);
+}
+
+TEST_F(Workers, OfTwoUsersOrTwoPeopleDoNotWaitForOneAnother) {
+    world.account.threads = 3;
+    Gate gate(3); // opens only when all three are inside
+    world.vaultra->whenApplying = [&](const CXDChangeRecordPtr&, bool*) {
+        gate.pass();
+        return true;
+    };
+    world.engine->applyChangeRecords({update("P1", 4, "ann"), update("P1", 4, "bob"), update("P2", 4, "ann")});
+    EXPECT_EQ(world.progress.did, 3);
 }
 
 TEST_F(Workers, FoldEveryMembershipIntoTheStateThoughTheyRunSideBySide) {
