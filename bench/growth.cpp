@@ -16,10 +16,14 @@
 #include "engine/PublicationCache.h"
 #include "foundation/Preferences.h"
 
+#include "contacts/Identifier.h"
+#include "foundation/PropertyList.h"
+
 #include <algorithm>
 #include <ctime>
 #include <iostream>
 #include <nlohmann/json.hpp>
+#include <sys/resource.h>
 
 using namespace rolvane;
 
@@ -30,6 +34,12 @@ const RemoteLocation kLocation("http://store.example/ada/Contacts");
 double cpuSeconds() {
     timespec time{};
     clock_gettime(CLOCK_PROCESS_CPUTIME_ID, &time);
+    return static_cast<double>(time.tv_sec) + static_cast<double>(time.tv_nsec) / 1e9;
+}
+
+double wallSeconds() {
+    timespec time{};
+    clock_gettime(CLOCK_MONOTONIC, &time);
     return static_cast<double>(time.tv_sec) + static_cast<double>(time.tv_nsec) / 1e9;
 }
 
@@ -53,6 +63,71 @@ void publishEverything(CXRolvane& database) {
     locations.addValue(Value(kLocation), kCXPublishLabel);
     database.allGroup()->setValue(CXMultiValue(locations), kCXRemoteLocationProperty);
     database.save();
+}
+
+double peakMegabytes() {
+    rusage usage{};
+    getrusage(RUSAGE_SELF, &usage);
+    return static_cast<double>(usage.ru_maxrss) / 1024;
+}
+
+// A publisher's data as a subscriber receives it, applied to a new database: one update and one entry into the
+// all-contacts group a person, and every person a member of one of twenty groups.
+void measureApplying(Steps& steps, CXRolvane& publisher, const std::string& directory) {
+    const RemoteLocation location("http://store.example/bob/Contacts");
+    const UserName bob("bob");
+    CXRolvane::Options options;
+    options.path = directory + "/subscribed.db";
+    options.program = "RolvaneManager";
+    CXRolvane database(options);
+    database.addRecord(CXSubscription::create(location));
+    database.save();
+    Preferences preferences(directory + "/subscribed-preferences.db");
+    NotificationCenter center;
+    test::FakeEngine engine;
+    CXDCXConduit conduit(engine, {database, preferences, Clock::system(), center});
+    std::vector<CXRow> people;
+    publisher.forEachPersonModifiedSince(Date::distantPast(), kCXPersonTable,
+                                         [&](const CXRow& row) { people.push_back(row); });
+
+    const auto apply = [&](int type, std::optional<UniqueId> person, std::optional<UniqueId> group,
+                           Value payload = {}) {
+        conduit.applyChangeRecord(
+            std::make_shared<CXDChangeRecord>(CXDSyncSourceVaultra, type, bob, person, group, std::move(payload)));
+    };
+    const auto copyOf = [](const CXRow& row) { return cxUIDWithTableName(row.uniqueId, kCXSubscribedPersonTable); };
+    const auto groupOf = [](size_t i) { return UniqueId(std::to_string(i % 20) + ":CXSubscribedGroup"); };
+    const auto updateAll = [&] {
+        for (const CXRow& row : people) {
+            Dictionary content = BinaryValue::decode(*row.encoded).dictionary();
+            conduit.stampWithRemoteLocation(content, location);
+            apply(CXDUpdateRecord, copyOf(row), std::nullopt, content);
+        }
+    };
+    conduit.open();
+    steps.time("applying updates of new people", updateAll);
+    steps.time("applying members", [&] {
+        for (size_t i = 0; i < 20; i++)
+            apply(CXDCreateStructureForGroup, std::nullopt, groupOf(i), Dictionary{{kCXGroupNameProperty, "Group"}});
+        for (size_t i = 0; i < people.size(); i++) {
+            apply(CXDAddRecordToGroup, copyOf(people[i]), UniqueId(kCXAllGroupUID));
+            apply(CXDAddRecordToGroup, copyOf(people[i]), groupOf(i));
+        }
+    });
+    steps.time("saving members", [&] { conduit.close(); });
+    conduit.open();
+    steps.time("applying updates of known people", updateAll);
+    const double began = wallSeconds();
+    steps.time("saving known people", [&] { conduit.close(); });
+    steps.say("seconds in which nobody else could save", wallSeconds() - began);
+    conduit.open();
+    steps.time("scan after applying", [&] { conduit.changeRecords(); });
+    steps.time("applying removals", [&] {
+        for (const CXRow& row : people) apply(CXDRemoveRecordFromGroup, row.uniqueId, UniqueId(kCXAllGroupUID));
+    });
+    steps.time("saving removals", [&] { conduit.close(); });
+    steps.say("people left", static_cast<double>(database.countPeople(location)));
+    steps.say("peak megabytes", peakMegabytes());
 }
 
 void measure(const std::string& cards, const std::string& directory) {
@@ -107,6 +182,7 @@ void measure(const std::string& cards, const std::string& directory) {
     conduit.open();
     steps.time("scan without changes", [&] { captured = conduit.changeRecords(); });
     steps.say("captured without changes", static_cast<double>(captured.size()));
+    measureApplying(steps, database, directory);
     steps.print();
 }
 

@@ -120,6 +120,9 @@ bool CXDCXConduit::updateRecord(const CXDChangeRecordPtr& record) {
     if (!cxIsSubscribed(uid)) {
         content = content.mutableCopy();
         content.remove(kCXRemoteLocationProperty);
+        // The shared form may have found a copy. It stays where it came from, or no unsubscribing would take it away.
+        if (person && person->isSubscribed())
+            content.set(kCXRemoteLocationProperty, person->valueForProperty(kCXRemoteLocationProperty));
     }
     if (!person) {
         person = CXPerson::initWithUniqueId(uid);

@@ -131,6 +131,26 @@ TEST_F(Apply, ASharedIdentifierFindsTheSubscribedCopyBeforeThePlainRecord) {
     EXPECT_EQ(nameOf("B:CXPerson"), "Own");
 }
 
+TEST_F(Apply, ACopyThatTheSharedIdentifierFindsStaysWhereItCameFrom) {
+    subscribedPerson("Bert", "B");
+    EXPECT_TRUE(apply(CXDUpdateRecord, "<self>", "B:CXPerson", nullptr, card("Bertram", kOwnLocation)));
+    EXPECT_EQ(nameOf("B:CXSubscribedPerson"), "Bertram");
+    EXPECT_EQ(personAt("B:CXSubscribedPerson")->remoteLocation(), kBobsLocation);
+}
+
+TEST_F(Apply, AFloodOfContentDoesNotWaitInMemoryForTheEndOfThePass) {
+    const Bytes photo(3 << 20, 7);
+    size_t most = 0;
+    for (int i = 0; i < 15; i++) {
+        Dictionary content = card("Bert");
+        content.set(kCXPhotoProperty, photo);
+        apply(CXDUpdateRecord, "bob", ("B" + std::to_string(i) + ":CXSubscribedPerson").c_str(), nullptr, content);
+        most = std::max(most, database.unsavedSize());
+    }
+    EXPECT_LE(most, size_t{32} << 20);
+    EXPECT_EQ(database.countPeople(kBobsLocation), 15u);
+}
+
 TEST_F(Apply, DeletingAPersonTakesItsMembershipsAlong) {
     const auto bert = subscribedPerson("Bert", "B");
     subscribedGroup("Friends", "G")->addMember(bert);
