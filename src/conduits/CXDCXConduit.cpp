@@ -69,6 +69,10 @@ void CXDCXConduit::open() {
     _lastSyncDate = _world.preferences.get(kDaemonDomain, kLastSyncDateKey).date().value_or(Date::distantPast());
     _scan.reset();
     _publishers.clear();
+    // A trickle pass has gathered before it opens the conduits.
+    const int64_t now = rolvane().journalPosition();
+    _editsKnown = _captured != 0 ? _captured : now;
+    _uncaptured.clear();
 }
 
 void CXDCXConduit::close() {
@@ -79,6 +83,7 @@ void CXDCXConduit::close() {
     _world.preferences.synchronize(kDaemonDomain);
     if (_scan) rolvane().advanceCursorTo(_scan->journalPosition, _scan->since);
     _scan.reset();
+    _captured = 0;
 }
 
 CXDChangeRecords CXDCXConduit::changeRecords() {
@@ -102,6 +107,7 @@ CXDChangeRecords CXDCXConduit::changeRecords() {
     capture.addGroup(rolvane().allGroup());
 
     _scan = scan;
+    _editsKnown = scan.journalPosition;
     return capture.take();
 }
 
@@ -111,6 +117,7 @@ void CXDCXConduit::rolvaneChanged(const Notification& notification) {
     engine().updateStateAndExitIfNeeded();
     if (notification.userInfo[kCXSenderProcessID].integer() == _world.processID) return;
     engine().checkCXShareCount();
+    _captured = rolvane().journalPosition();
 
     const Array inserted = notification.userInfo[kCXInsertedRecords].array();
     const Array updated = notification.userInfo[kCXUpdatedRecords].array();
@@ -125,6 +132,7 @@ void CXDCXConduit::rolvaneChanged(const Notification& notification) {
         engine().syncPrefs();
     else
         engine().applyChangeRecords(records);
+    _captured = 0;
 }
 
 void CXDCXConduit::captureInserted(ChangeCapture& capture, const Array& identifiers) {

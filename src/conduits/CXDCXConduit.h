@@ -8,6 +8,7 @@
 #include <string>
 #include <unistd.h>
 #include <unordered_map>
+#include <unordered_set>
 #include <vector>
 
 namespace rolvane {
@@ -129,6 +130,8 @@ private:
     std::shared_ptr<CXGroup> groupOf(const CXDChangeRecord& record);
     std::shared_ptr<CXGroup> subgroupOf(const CXDChangeRecord& record);
     bool mayChange(const CXDChangeRecord& record, const CXRecord& found);
+    // Has somebody else saved the record since this pass gathered its changes? That edit is still to be captured.
+    bool hasUncapturedEdit(const UniqueId& uid);
     void captureInserted(ChangeCapture& capture, const Array& identifiers);
     void captureUpdated(ChangeCapture& capture, const Array& identifiers);
     void captureDeleted(ChangeCapture& capture, const Array& identifiers);
@@ -136,6 +139,9 @@ private:
     World _world;
     bool _readOnlyKillSwitch = false;
     std::optional<Scan> _scan;
+    int64_t _captured = 0;                                    // the journal's position when this pass gathered, and
+    int64_t _editsKnown = 0;                                  // the one up to which
+    std::unordered_set<UniqueId> _uncaptured;                 // holds what others have saved since
     std::unordered_map<RemoteLocation, UserName> _publishers; // whose the locations are, as far as asked
     ObservationHandle _databaseChanged;
 };

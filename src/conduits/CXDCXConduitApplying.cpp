@@ -2,6 +2,7 @@
 
 #include "acl/CXDCXACLManager.h"
 #include "conduits/CXDCXConduit.h"
+#include "contacts/CXMerger.h"
 #include "contacts/CXRolvane.h"
 #include "contacts/Constants.h"
 #include "contacts/Identifier.h"
@@ -102,6 +103,15 @@ CXGroupRef CXDCXConduit::subgroupOf(const CXDChangeRecord& record) {
     return group && mayChange(record, *group) ? group : nullptr;
 }
 
+bool CXDCXConduit::hasUncapturedEdit(const UniqueId& uid) {
+    const int64_t now = rolvane().journalPosition();
+    if (now > _editsKnown) {
+        for (const UniqueId& changed : rolvane().changedByOthers(_editsKnown, now)) _uncaptured.insert(changed);
+        _editsKnown = now;
+    }
+    return _uncaptured.contains(uid);
+}
+
 // -- people
 
 bool CXDCXConduit::updateRecord(const CXDChangeRecordPtr& record) {
@@ -128,6 +138,9 @@ bool CXDCXConduit::updateRecord(const CXDChangeRecordPtr& record) {
         person = CXPerson::initWithUniqueId(uid);
         rolvane().addRecord(person);
     }
+    // Saved while this pass runs, and told to nobody yet: as with two changes that meet in the queue, nothing of either
+    // is lost, and the edit is delivered after the pass.
+    if (hasUncapturedEdit(person->uniqueId())) content = CXMerger::merged(content, person->dictionaryRepresentation());
     person->resetWithDictionary(content, true, false);
     return true;
 }

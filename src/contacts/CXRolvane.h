@@ -113,8 +113,9 @@ public:
     // The unit of work -----------------------------------------------------------------------------------------------
     // Writes all unsaved changes in one transaction with one journal entry a record, then tells the other processes.
     // Nothing unsaved: nothing happens. An update of a record that another process has removed meanwhile is dropped;
-    // other processes' changes to other properties of the same record are kept. Of two processes that subscribe to one
-    // location at a time, the first one's subscription stays. True always; throws on failure.
+    // other processes' changes to other properties of the same record are kept, of a record that was replaced as a
+    // whole their changes to any. Of two processes that subscribe to one location at a time, the first one's
+    // subscription stays. True always; throws on failure.
     bool save();
     bool hasUnsavedChanges() const;
     size_t unsavedSize() const; // bytes of content that wait in memory for the save, roughly
@@ -157,6 +158,8 @@ public:
     // saves dated at or before `scannedSince` were not captured (they were saved while an earlier pass ended): the
     // cursor stops in front of the first of them and they are delivered. Never moves backwards. Durable on return.
     void advanceCursorTo(int64_t position, Date scannedSince);
+    // The records that other programs have saved behind one position of the journal, up to another.
+    std::vector<UniqueId> changedByOthers(int64_t after, int64_t until);
     std::vector<CXJournalEntry> journalEntries(int64_t after, size_t limit = 1000);
 
     const std::string& path() const;

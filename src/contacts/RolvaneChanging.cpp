@@ -97,6 +97,7 @@ void CXRolvane::Impl::replaceProperties(const UniqueId& uid, Dictionary fresh) {
     for (const char* kept : {kCXUIDProperty, kCXCreationDateProperty, kCXModificationDateProperty}) fresh.remove(kept);
     PendingRecord& p = pending(uid);
     work.replace(p, fresh);
+    if (const auto& row = storedRow(uid); row && !p.isInsertion()) p.replacedRow = row->properties;
     p.location = locationOf(is, fresh);
 }
 

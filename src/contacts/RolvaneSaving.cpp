@@ -18,6 +18,7 @@ public:
         : _store(store), _journal(journal), _identity(identity), _program(program), _date(date) {}
 
     void write(const UnitOfWork& work) {
+        _work = &work;
         auto records = work.inOrder();
         for (const auto& [uid, record] : records)
             if (record->deleted || record->purged) removeRecord(uid, *record);
@@ -50,11 +51,13 @@ private:
         if (row->kind == RecordKind::subscription) removeCopies(row->location);
     }
 
-    // What other processes have added to a location since its removal was asked for.
+    // What other processes have added to a location since its removal was asked for. What was changed here was removed
+    // with it already, or has moved to another location.
     void removeCopies(const std::string& location) {
         for (RecordKind kind :
              {RecordKind::subscribedGroup, RecordKind::subscribedPerson, RecordKind::allSubscribedGroup})
             for (const auto& [number, uid] : _store.recordsOf(kind, location)) {
+                if (_work->isRecordWithChanges(uid)) continue;
                 _store.removeRow(number);
                 if (!isAllKind(kind)) note(uid, CXChangeKind::deleted);
             }
@@ -82,6 +85,18 @@ private:
         return once && _store.firstOfLocation(record.kind, record.location).has_value();
     }
 
+    // A replacement that another process has overtaken: the properties that it changed stay as it left them.
+    static Dictionary withChangesOfOthers(const Dictionary& ours, const PendingRecord& record, const StoredRow& row) {
+        const Dictionary before = BinaryValue::decode(*record.replacedRow).dictionary();
+        const Dictionary theirs = BinaryValue::decode(*row.properties).dictionary();
+        Dictionary all = ours.mutableCopy();
+        for (const auto& [property, value] : theirs)
+            if (value != before[property]) all.set(property, value);
+        for (const auto& [property, value] : before)
+            if (!theirs.contains(property)) all.remove(property);
+        return all;
+    }
+
     static Bytes encodedOf(const PendingRecord& record, const Dictionary& properties) {
         return record.whole && record.changes.empty() ? *record.whole : BinaryValue::encode(properties);
     }
@@ -89,9 +104,12 @@ private:
     void updateRow(const UniqueId& uid, const PendingRecord& record, const StoredRow& row) {
         Dictionary before = record.replaced ? Dictionary() : BinaryValue::decode(*row.properties).dictionary();
         Dictionary after = record.over(before);
-        Bytes encoded = encodedOf(record, after);
+        const bool changedMeanwhile = record.replacedRow && *record.replacedRow != *row.properties;
+        if (changedMeanwhile) after = withChangesOfOthers(after, record, row);
+        Bytes encoded = changedMeanwhile ? BinaryValue::encode(after) : encodedOf(record, after);
         if (encoded == *row.properties && record.kind == row.kind) return; // nothing has changed after all
-        _store.updateRow(row.id, record.kind, after, encoded, _date, _program);
+        _store.updateRow(row.id, record.kind, after, encoded, _date,
+                         changedMeanwhile ? row.writer : _program); // it holds an edit of theirs
         note(record.kind == RecordKind::allGroup ? UniqueId(_identity + ":" + std::string(kCXInfoTable)) : uid,
              CXChangeKind::updated);
     }
@@ -141,6 +159,7 @@ private:
     const std::string& _identity;
     const std::string& _program;
     Date _date;
+    const UnitOfWork* _work = nullptr;
     int64_t _save = 0;
     std::set<UniqueId> _noted;
 };

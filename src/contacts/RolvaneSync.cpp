@@ -106,6 +106,14 @@ void CXRolvane::advanceCursorTo(int64_t position, Date scannedSince) {
     if (to > from) _impl->journal.setCursor(_impl->options.program, to);
 }
 
+std::vector<UniqueId> CXRolvane::changedByOthers(int64_t after, int64_t until) {
+    std::lock_guard lock(_impl->mutex);
+    std::vector<UniqueId> changed;
+    for (const CXJournalEntry& entry : _impl->journal.foreignEntries(after, until, _impl->options.program))
+        changed.push_back(entry.uniqueId);
+    return changed;
+}
+
 std::vector<CXJournalEntry> CXRolvane::journalEntries(int64_t after, size_t limit) {
     std::lock_guard lock(_impl->mutex);
     return _impl->journal.entries(after, limit);

@@ -149,6 +149,48 @@ TEST_F(OwnWrites, AnEditOfACopyByAPersonIsStillCapturedWhetherByScanOrByJournal)
     EXPECT_EQ(lines(pass()), Texts{});
 }
 
+TEST_F(OwnWrites, AnEditSavedAfterTheScanIsNotOverwrittenByWhatArrivesInThatPass) {
+    pass([&] { everythingArrives(); });
+    pass([&] {
+        const auto copy = application.recordForUniqueId(UniqueId("B:CXSubscribedPerson"));
+        copy->setValue(Value("edited"), kCXNoteProperty);
+        application.save();
+        Dictionary content = card("Bert");
+        content.set(kCXLastNameProperty, "Arrived");
+        apply(CXDUpdateRecord, "bob", "B:CXSubscribedPerson", nullptr, content);
+    });
+    const auto copy = personAt("B:CXSubscribedPerson");
+    EXPECT_EQ(copy->valueForProperty(kCXNoteProperty), Value("edited"));
+    EXPECT_EQ(copy->valueForProperty(kCXLastNameProperty), Value("Arrived"));
+    EXPECT_TRUE(database.hasExternalChanges()) << "it is delivered after the pass";
+}
+
+TEST_F(OwnWrites, AnEditSavedBetweenTheApplyingAndTheSaveSurvivesToo) {
+    pass([&] { everythingArrives(); });
+    pass([&] {
+        Dictionary content = card("Bertram");
+        content.set(kCXLastNameProperty, "Arrived");
+        apply(CXDUpdateRecord, "bob", "B:CXSubscribedPerson", nullptr, content);
+        const auto copy = application.recordForUniqueId(UniqueId("B:CXSubscribedPerson"));
+        copy->setValue(Value("edited"), kCXNoteProperty);
+        application.save();
+    });
+    const auto copy = personAt("B:CXSubscribedPerson");
+    EXPECT_EQ(copy->valueForProperty(kCXNoteProperty), Value("edited"));
+    EXPECT_EQ(copy->valueForProperty(kCXFirstNameProperty), Value("Bertram"));
+    EXPECT_EQ(database.personRow(copy->uniqueId())->writer, "rolvane") << "an edit of a person's is still in it";
+    EXPECT_TRUE(database.hasExternalChanges());
+}
+
+TEST_F(OwnWrites, AnEditThatWasCapturedIsReplacedByWhatTheQueueMadeOfIt) {
+    pass([&] { everythingArrives(); });
+    application.recordForUniqueId(UniqueId("B:CXSubscribedPerson"))->setValue(Value("edited"), kCXNoteProperty);
+    application.save();
+    clock.advance(1);
+    pass([&] { apply(CXDUpdateRecord, "bob", "B:CXSubscribedPerson", nullptr, card("Bertram")); });
+    EXPECT_FALSE(personAt("B:CXSubscribedPerson")->valueForProperty(kCXNoteProperty));
+}
+
 TEST_F(OwnWrites, ApplyingTheSameAgainWritesNothing) {
     const Dictionary content = card("Bert");
     const auto applyAll = [&] {
