@@ -56,7 +56,9 @@ std::optional<CXACE> CXACE::initWithACENode(const CXDAVNode& node) {
     ace._grant = grant != nullptr;
     ace._inverted = inverted != nullptr;
     ace._protected = node.firstChild("protected") != nullptr;
-    ace._inherited = node.firstChild("inherited") != nullptr;
+    const CXDAVNode* inherited = node.firstChild("inherited");
+    ace._inherited = inherited != nullptr;
+    if (inherited && inherited->firstChild("href")) ace._inheritedFrom = inherited->firstChild("href")->content();
     ace.addPrivilegesIn(grant ? *grant : *deny);
     return ace;
 }

@@ -27,11 +27,12 @@ public:
     static std::optional<CXACE> initWithACENode(const CXDAVNode& node);
 
     Principal principal() const { return _principal; }
-    const std::string& href() const { return _href; } // as the server wrote it, "" for other kinds
-    bool isGrant() const { return _grant; }           // else it denies
-    bool isInverted() const { return _inverted; }     // it is for everybody but the principal
-    bool isProtected() const { return _protected; }   // the server's own, never sent back
-    bool isInherited() const { return _inherited; }   // it belongs to another resource's list
+    const std::string& href() const { return _href; }                   // as the server wrote it, "" for other kinds
+    bool isGrant() const { return _grant; }                             // else it denies
+    bool isInverted() const { return _inverted; }                       // it is for everybody but the principal
+    bool isProtected() const { return _protected; }                     // the server's own, never sent back
+    bool isInherited() const { return _inherited; }                     // it belongs to another resource's list
+    const std::string& inheritedFrom() const { return _inheritedFrom; } // that resource's href, "" when none is named
     const std::set<std::string>& privileges() const { return _privileges; } // names in DAV:, "{uri}name" others
 
     // What the privileges hold, whether they are granted or denied. An aggregate holds its parts (RFC 3744 section 3);
@@ -48,7 +49,7 @@ private:
 
     CXDAVNode _node;
     Principal _principal = Principal::self;
-    std::string _href;
+    std::string _href, _inheritedFrom;
     bool _grant = true, _inverted = false, _protected = false, _inherited = false;
     std::set<std::string> _privileges;
 };

@@ -5,6 +5,7 @@
 
 #include <algorithm>
 #include <memory>
+#include <set>
 
 namespace rolvane {
 namespace {
@@ -69,15 +70,15 @@ std::string reasonIn(const HttpResponse& answer) {
 // The list at one place, as the store has it.
 struct StoreAccessLists::OnStore {
     Url asked;
-    std::vector<CXACE> entries; // without the server's own and those of other resources
-    std::string owner;          // the owner's principal, "" when the store does not say
+    std::vector<CXACE> entries;   // without the server's own and those of other resources
+    std::vector<CXACE> inherited; // those of other resources, without the server's own
+    std::string inheritedFrom;    // the one resource that all entries here belong to; "" when there are own ones
+    std::string owner;            // the owner's principal, "" when the store does not say
     std::shared_ptr<StorePrincipals> principals;
 };
 
-std::optional<StoreAccessLists::OnStore> StoreAccessLists::fetch(const Url& name, bool securely) {
-    const auto target = _session.endpoint(name, securely);
-    if (!target || _session.keepsAccessLists() == false) return std::nullopt;
-    HttpRequest request = StoreSession::propfind(*target, 0);
+std::optional<StoreAccessLists::OnStore> StoreAccessLists::fetch(const Url& endpoint) {
+    HttpRequest request = StoreSession::propfind(endpoint, 0);
     request.body = std::make_shared<const std::string>(kBody);
     request.limits.maxBodyBytes = 8u << 20;
     const HttpResponse answer = _session.send(std::move(request));
@@ -89,18 +90,35 @@ std::optional<StoreAccessLists::OnStore> StoreAccessLists::fetch(const Url& name
     if (!list) return std::nullopt;
 
     OnStore found;
-    found.asked = *target;
-    found.principals = std::make_shared<StorePrincipals>(_session, *target,
+    found.asked = endpoint;
+    found.principals = std::make_shared<StorePrincipals>(_session, endpoint,
                                                          hrefsIn(davProperty(response, "principal-collection-set")));
     const auto owners = hrefsIn(davProperty(response, "owner"));
     if (!owners.empty()) found.owner = owners.front();
+    std::set<std::string> sources;
     for (const CXDAVNode* node : list->childNodesMatchingString("ace")) {
         const auto ace = CXACE::initWithACENode(*node);
         if (!ace) return std::nullopt; // to set the list without an entry that is not understood would take it away
-        if (ace->isProtected() || ace->isInherited()) continue;
+        sources.insert(ace->inheritedFrom());
+        if (ace->isProtected()) continue;
         if (ace->principal() == CXACE::Principal::href) found.principals->learn(ace->href());
-        found.entries.push_back(*ace);
+        (ace->isInherited() ? found.inherited : found.entries).push_back(*ace);
     }
+    if (sources.size() == 1) found.inheritedFrom = *sources.begin();
+    return found;
+}
+
+// The list that a place without one of its own inherits, if it is the parent's and of the same owner.
+std::optional<StoreAccessLists::OnStore> StoreAccessLists::fetchParent(const OnStore& below) {
+    const auto parent = below.principals->resolved(below.inheritedFrom);
+    if (!parent || below.inheritedFrom.empty() || below.owner.empty()) return std::nullopt;
+    const auto components = parent->pathComponents();
+    auto expected = below.asked.pathComponents();
+    if (expected.empty()) return std::nullopt;
+    expected.pop_back();
+    if (components != expected) return std::nullopt;
+    auto found = fetch(*parent);
+    if (!found || found->owner != below.owner || !found->inheritedFrom.empty()) return std::nullopt;
     return found;
 }
 
@@ -113,7 +131,7 @@ bool StoreAccessLists::isOurs(const OnStore& found, const CXACE& ace) const {
 
 AccessLists StoreAccessLists::listsOf(const OnStore& found) const {
     AccessLists lists;
-    for (const CXACE& ace : found.entries) {
+    for (const CXACE& ace : found.inheritedFrom.empty() ? found.entries : found.inherited) {
         if (!isOurs(found, ace)) continue;
         const std::string name = found.principals->nameFor(ace.href());
         if (ace.canRead()) addIfAbsent(lists.readers, name);
@@ -123,7 +141,9 @@ AccessLists StoreAccessLists::listsOf(const OnStore& found) const {
 }
 
 std::optional<AccessLists> StoreAccessLists::read(const Url& name, bool securely) {
-    const auto found = fetch(name, securely);
+    const auto target = _session.endpoint(name, securely);
+    if (!target || _session.keepsAccessLists() == false) return std::nullopt;
+    const auto found = fetch(*target);
     if (!found) return std::nullopt;
     AccessLists lists = listsOf(*found);
     const std::lock_guard guard(_mutex);
@@ -139,7 +159,7 @@ bool StoreAccessLists::dropUnknown(const Url& name, OnStore& found, std::vector<
            });
 }
 
-bool StoreAccessLists::send(const Url& name, bool securely, OnStore& found, const AccessLists& wanted) {
+HttpResponse StoreAccessLists::send(OnStore& found, const AccessLists& wanted) {
     std::string body = "<?xml version=\"1.0\" encoding=\"utf-8\" ?><D:acl xmlns:D=\"DAV:\">";
     for (const CXACE& ace : found.entries)
         if (!isOurs(found, ace)) body += ace.xml();
@@ -149,13 +169,16 @@ bool StoreAccessLists::send(const Url& name, bool securely, OnStore& found, cons
         body += grantTo(found.principals->hrefFor(who).value_or(std::string()), contains(wanted.readers, who),
                         contains(wanted.writers, who));
     body += "</D:acl>";
-
-    const auto target = _session.endpoint(name, securely);
-    if (!target) return false;
-    HttpRequest request = StoreSession::request("ACL", *target);
+    HttpRequest request = StoreSession::request("ACL", found.asked);
     request.headers = {{"Content-Type", "application/xml; charset=utf-8"}};
     request.body = std::make_shared<const std::string>(std::move(body));
-    const HttpResponse answer = _session.send(std::move(request));
+    return _session.send(std::move(request));
+}
+
+bool StoreAccessLists::sendOrInherit(const Url& name, OnStore& found, const AccessLists& wanted) {
+    HttpResponse answer = send(found, wanted);
+    if (answer.status == 403 && !found.inheritedFrom.empty())
+        if (auto parent = fetchParent(found)) answer = send(*parent, wanted);
     if (answer.ok()) return true;
     CXLog("The access list of %@ could not be set: %@", name,
           answer.complete() ? std::to_string(answer.status) + ", " + reasonIn(answer) : answer.detail);
@@ -176,7 +199,8 @@ bool StoreAccessLists::set(const Url& name, bool securely, const AccessLists& as
         if (const auto seen = _known.find(key); seen != _known.end()) known = seen->second;
     }
     if (known == wanted) return true;
-    auto found = fetch(name, securely);
+    const auto target = _session.endpoint(name, securely);
+    auto found = target && _session.keepsAccessLists() != false ? fetch(*target) : std::nullopt;
     if (!found) return false;
     const AccessLists theirs = listsOf(*found);
     AccessLists next = wanted;
@@ -186,7 +210,7 @@ bool StoreAccessLists::set(const Url& name, bool securely, const AccessLists& as
     const bool readersKnown = dropUnknown(name, *found, next.readers);
     const bool complete = dropUnknown(name, *found, next.writers) && readersKnown;
     const bool isThere = sameNames(next.readers, theirs.readers) && sameNames(next.writers, theirs.writers);
-    if (!isThere && !send(name, securely, *found, next)) return false;
+    if (!isThere && !sendOrInherit(name, *found, next)) return false;
     if (!complete) return false;
     const std::lock_guard guard(_mutex);
     _known[key] = std::move(wanted);

@@ -28,6 +28,10 @@ struct AccessLists {
 //
 // Several programs of one owner may set one list. So a list that this client has seen is changed by what the caller
 // changed since then, and what others changed meanwhile stays; and a list that the caller did not change is not sent.
+//
+// Some servers keep one list for all of an owner's tree, at its root. A place below has no entries of its own then:
+// what it inherits is read in their stead, and where the server refuses a list for the place itself, the one that it
+// inherits from is set, if that is the place's own parent and belongs to the same owner.
 class StoreAccessLists {
 public:
     explicit StoreAccessLists(StoreSession& session) : _session(session) {}
@@ -40,11 +44,13 @@ public:
 
 private:
     struct OnStore;
-    std::optional<OnStore> fetch(const Url& name, bool securely);
+    std::optional<OnStore> fetch(const Url& endpoint);
+    std::optional<OnStore> fetchParent(const OnStore& below);
     AccessLists listsOf(const OnStore& found) const;
     bool isOurs(const OnStore& found, const CXACE& ace) const;
     static bool dropUnknown(const Url& name, OnStore& found, std::vector<std::string>& list);
-    bool send(const Url& name, bool securely, OnStore& found, const AccessLists& wanted);
+    HttpResponse send(OnStore& found, const AccessLists& wanted);
+    bool sendOrInherit(const Url& name, OnStore& found, const AccessLists& wanted);
 
     StoreSession& _session;
     std::mutex _mutex;                         // guards the following

@@ -27,9 +27,11 @@ public:
     // Uses this href for the name of the principal there from now on, because the store itself has written it so.
     void learn(const std::string& href);
 
+    // The href as a URL of the same server; nothing for another one's.
+    std::optional<Url> resolved(const std::string& href) const;
+
 private:
     enum class Answer { found, notThere, silent };
-    std::optional<Url> resolved(const std::string& href) const;
     Answer lookAt(const Url& place, int depth, const std::string& name, std::string& href);
 
     StoreSession& _session;

@@ -375,6 +375,44 @@ TEST_F(StoreLists, APartlyRefusedListIsARefusal) {
     EXPECT_FALSE(set({"bob"}, {}));
 }
 
+// -- one list for a tree
+
+TEST_F(StoreLists, ThatAPlaceInheritsAreReadAndSetWhereTheyBelong) {
+    store.rootOfTheOneList = "/dav/alice/";
+    store.entries = {AclStore::ace("/principals/bob", {"read"})};
+    EXPECT_EQ(read(), "r bob; w");
+    EXPECT_TRUE(set({"bob", "carl"}, {"carl"})) << log.text();
+    EXPECT_EQ(read(), "r bob carl; w carl");
+    EXPECT_TRUE(set({}, {}));
+    EXPECT_EQ(read(), "r; w");
+    EXPECT_TRUE(set({"bob"}, {})) << "an empty list says where it belongs by the owner's entry";
+    EXPECT_EQ(read(), "r bob; w");
+}
+
+TEST_F(StoreLists, AListThatIsInheritedFromElsewhereIsNeverSetThere) {
+    const auto refused = [this](const std::string& root, const std::string& owner) {
+        store.rootOfTheOneList = root;
+        store.ownerOfTheRoot = owner;
+        store.entries = {AclStore::ace("/principals/bob", {"read"})};
+        const bool done = set({"bob", "carl"}, {});
+        return !done && store.entries.size() == 1;
+    };
+    EXPECT_TRUE(refused("/dav/", "/principals/alice")) << "farther away than the parent";
+    EXPECT_TRUE(refused("/dav/bob/", "/principals/alice"));
+    EXPECT_TRUE(refused("https://elsewhere.example.org/dav/alice/", "/principals/alice"));
+    EXPECT_TRUE(refused("/dav/alice/", "/principals/admin")) << "another owner's";
+    EXPECT_FALSE(refused("/dav/alice/", "/principals/alice"));
+}
+
+TEST_F(StoreLists, InheritedEntriesDoNotCountBesideOwnOnes) {
+    store.entries = {
+        AclStore::ace("/principals/bob", {"read"}),
+        AclStore::ace("/principals/carl", {"write"}, "<D:inherited><D:href>/dav/alice/</D:href></D:inherited>")};
+    EXPECT_EQ(read(), "r bob; w");
+    EXPECT_TRUE(set({}, {}));
+    EXPECT_EQ(store.lists(), "r; w");
+}
+
 // -- principals
 
 TEST_F(StoreLists, ANameIsLookedUpInThePrincipalCollection) {

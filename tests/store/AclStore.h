@@ -50,14 +50,22 @@ public:
         const std::string path = request.url.encodedPath();
         if (request.method == "OPTIONS") return answerOf(200, {{"dav", announces}});
         if (path.starts_with("/principals")) return principal(path, request);
-        if (request.method == "ACL") return set(*request.body);
+        if (request.method == "ACL") return set(path, *request.body);
         if (request.method == "PROPFIND" && bodies.back().find("<D:acl/>") != std::string::npos) return shown(path);
         return answerOf(404);
     }
     HttpResponse shown(const std::string& path) const {
-        std::string properties = "<D:acl>" + protectedEntries;
-        for (const auto& entry : entries) properties += entry;
-        properties += "</D:acl><D:owner><D:href>/principals/alice</D:href></D:owner><D:principal-collection-set>";
+        std::string list = protectedEntries;
+        for (const auto& entry : entries) list += entry;
+        if (!rootOfTheOneList.empty() && path != rootOfTheOneList) {
+            const std::string end = "</D:ace>",
+                              from = "<D:inherited><D:href>" + rootOfTheOneList + "</D:href></D:inherited>";
+            for (size_t at = list.find(end); at != list.npos; at = list.find(end, at + from.size() + end.size()))
+                list.insert(at, from);
+        }
+        std::string properties = "<D:acl>" + list + "</D:acl><D:owner><D:href>" +
+                                 (path == rootOfTheOneList ? ownerOfTheRoot : "/principals/alice") +
+                                 "</D:href></D:owner><D:principal-collection-set>";
         for (const auto& collection : collections) properties += "<D:href>" + collection + "</D:href>";
         return multistatus(response(path, properties + "</D:principal-collection-set>"));
     }
@@ -78,7 +86,10 @@ public:
         const auto found = people.find(path);
         return found == people.end() ? answerOf(404) : multistatus(shownAs(path, found->second));
     }
-    HttpResponse set(const std::string& body) {
+    HttpResponse set(const std::string& path, const std::string& body) {
+        if (!rootOfTheOneList.empty() && path != rootOfTheOneList)
+            return answerOf(
+                403, {}, "<?xml version=\"1.0\"?><D:error xmlns:D=\"DAV:\"><D:no-inherited-ace-conflict/></D:error>");
         if (setStatus != 200)
             return answerOf(setStatus, {}, "<?xml version=\"1.0\"?><D:error xmlns:D=\"DAV:\"><D:no-invert/></D:error>");
         const auto root = parseDAVTree(body);
@@ -111,6 +122,8 @@ public:
                                                  {"/principals/bob", "Bob"},
                                                  {"/principals/carl", "Carl"}}; // href to display name
     bool principalsAnswer = true;
+    std::string rootOfTheOneList; // not empty: the only place that has a list; what lies below inherits it
+    std::string ownerOfTheRoot = "/principals/alice";
     int setStatus = 200;
     RecordingTransport::Interceptor instead; // asked first
     std::vector<std::string> bodies;         // of every request
