@@ -208,7 +208,7 @@ void CXRolvane::forEachPersonModifiedSince(Date date, std::string_view table,
         rows = _impl->store.scan(wanted, position, kPage, true);
         size_t read = rows.size();
         std::erase_if(rows, [this](const CXRow& r) { return _impl->work.isRecordWithChanges(r.uniqueId); });
-        if (!_impl->work.memberships().empty())
+        if (_impl->work.changesMemberships())
             for (CXRow& row : rows) row.parentGroups = _impl->parents(row.uniqueId);
         lock.unlock();
         for (const CXRow& row : rows) call(row);

@@ -117,6 +117,12 @@ bool UnitOfWork::hidesStoredLinks(const UniqueId& uid) const {
     return record && (record->deleted || record->purged);
 }
 
+bool UnitOfWork::changesMemberships() const {
+    return !_memberships.empty() || std::any_of(_records.begin(), _records.end(), [](const auto& entry) {
+        return !isPerson(entry.second.kind) && (entry.second.deleted || entry.second.purged);
+    });
+}
+
 const PendingMembership* UnitOfWork::membershipIf(const UniqueId& group) const {
     auto found = _memberships.find(group);
     return found == _memberships.end() ? nullptr : &found->second;

@@ -11,6 +11,29 @@ std::vector<CXRow> rows(CXRolvane& database, Date since, std::string_view table 
     return all;
 }
 
+TEST(Scan, DoesNotSeeTheMembersOfAGroupThatWasTakenOutOrMadeAnew) {
+    TestDatabase d;
+    CXPersonRef ada = d.addPerson("Ada");
+    for (const char* uid : {"A:CXGroup", "B:CXGroup", "C:CXGroup"}) {
+        CXGroupRef group = CXGroup::initWithUniqueId(UniqueId(uid));
+        group->setValue("a group", kCXGroupNameProperty);
+        d->addRecord(group);
+        group->addMember(ada);
+    }
+    d->save();
+    d->removeRecord(d->recordForUniqueId(UniqueId("A:CXGroup")));
+    d->removeRecord(d->recordForUniqueId(UniqueId("B:CXGroup")));
+    CXGroupRef anew = CXGroup::initWithUniqueId(UniqueId("B:CXGroup"));
+    anew->setValue("another group", kCXGroupNameProperty);
+    d->addRecord(anew);
+    for (int round = 0; round < 2; round++, d->save()) {
+        std::vector<UniqueId> parents;
+        d->forEachPersonModifiedSince(Date::distantPast(), kCXPersonTable,
+                                      [&](const CXRow& row) { parents = row.parentGroups; });
+        EXPECT_EQ(parents, std::vector{UniqueId("C:CXGroup")});
+    }
+}
+
 TEST(Scan, FindsWhatWasModifiedStrictlyAfterTheDate) {
     TestDatabase d;
     d.addPerson("Old");
