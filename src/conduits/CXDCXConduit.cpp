@@ -84,6 +84,7 @@ void CXDCXConduit::close() {
     if (_scan) rolvane().advanceCursorTo(_scan->journalPosition, _scan->since);
     _scan.reset();
     _captured = 0;
+    _written.clear();
 }
 
 CXDChangeRecords CXDCXConduit::changeRecords() {

@@ -78,6 +78,9 @@ public:
     // The manager that the base finds, else a new one, kept under the URL's own text.
     std::shared_ptr<CXACLManager> ACLManagerForRemoteLocation(const Url& location) override;
 
+    // A person or group that was put into a group is looked for: its content may not have come.
+    bool holds(const CXDChangeRecord& record) override;
+
     void open() override;
     // Saves the database, forgets revoked users, moves the last-sync date to now and, after a full scan, the journal's
     // cursor behind what the scan captured.
@@ -143,6 +146,7 @@ private:
     int64_t _editsKnown = 0;                                  // the one up to which
     std::unordered_set<UniqueId> _uncaptured;                 // holds what others have saved since
     std::unordered_map<RemoteLocation, UserName> _publishers; // whose the locations are, as far as asked
+    std::unordered_set<UniqueId> _written;                    // people of this pass
     ObservationHandle _databaseChanged;
 };
 

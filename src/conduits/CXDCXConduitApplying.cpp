@@ -112,6 +112,14 @@ bool CXDCXConduit::hasUncapturedEdit(const UniqueId& uid) {
     return _uncaptured.contains(uid);
 }
 
+bool CXDCXConduit::holds(const CXDChangeRecord& record) {
+    const bool addsPerson = record.type() == CXDAddRecordToGroup;
+    if (!addsPerson && record.type() != CXDAddGroupToGroup) return true;
+    if (!namesAllGroup(record) && !groupOf(record)) return false;
+    if (!addsPerson) return subgroupOf(record) != nullptr;
+    return (record.person() && _written.contains(*record.person())) || personOf(record) != nullptr;
+}
+
 // -- people
 
 bool CXDCXConduit::updateRecord(const CXDChangeRecordPtr& record) {
@@ -142,6 +150,7 @@ bool CXDCXConduit::updateRecord(const CXDChangeRecordPtr& record) {
     // is lost, and the edit is delivered after the pass.
     if (hasUncapturedEdit(person->uniqueId())) content = CXMerger::merged(content, person->dictionaryRepresentation());
     person->resetWithDictionary(content, true, false);
+    _written.insert(uid);
     return true;
 }
 

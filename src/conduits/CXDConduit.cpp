@@ -53,6 +53,10 @@ CXDChangeRecords CXDConduit::changeRecords() {
     return comparePriorStateToCurrentState(prior, currentState());
 }
 
+bool CXDConduit::holds(const CXDChangeRecord& /*record*/) {
+    return true;
+}
+
 bool CXDConduit::applyChangeRecordIfNeeded(const CXDChangeRecordPtr& record, bool* denied) {
     // The record's user itself, not its real user: that is how the location of a revoked subscription is written.
     const auto base = baseLocationForUser(record->user());

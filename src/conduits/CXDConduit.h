@@ -14,6 +14,7 @@ namespace rolvane {
 class CXFileManager;
 class CXRolvane;
 class Preferences;
+class WithdrawalNotice;
 
 // One sync source. The engine creates it, opens it, asks it for change records, hands it the records that are addressed
 // to it and closes it. No lock of its own: the engine keeps a conduit to one thread, but for applyChangeRecordIfNeeded
@@ -65,8 +66,14 @@ public:
     // Ends a subscription (or the owner's publication) here: forgets the user and cleans up.
     void cancelSharingTo(const RemoteLocation& location);
     // Takes away what came from the location, in one save. The owner's own: the marks of the publication only. Another
-    // user's: the copies and the subscription.
+    // user's: the copies and the subscription; before that they are kept where the person finds them again (when they
+    // cannot be kept they stay), and afterwards the person is told.
     void removeRecordsAssociateWithRemoteLocation(const RemoteLocation& location);
+
+    // After an apply that succeeded: does the source hold now what the record put there? A source may be done with a
+    // record whose object it does not have; nobody may then take it for something that was there and was removed. Base:
+    // yes.
+    virtual bool holds(const CXDChangeRecord& record);
 
     // True: this source is done with the record (applied, cancelled, or of a revoked location). An exception of the
     // base class costs one false and two log lines.
@@ -88,6 +95,7 @@ protected:
     // What a store conduit touches beside its store. Base: the process's own; borrowed.
     virtual CXRolvane& database() const;
     virtual Preferences& preferences() const;
+    virtual WithdrawalNotice* withdrawalNotice() const; // base: none; nothing is kept and nobody is told
     // Whether access lists are kept at the source, so that somebody else may have changed them. Base: yes.
     virtual bool keepsAccessLists() const { return true; }
 

@@ -1,6 +1,7 @@
 // The half of the conduit base that ends publications and subscriptions in the contact database.
 
 #include "conduits/CXDConduit.h"
+#include "conduits/WithdrawalNotice.h"
 #include "contacts/CXRolvane.h"
 #include "contacts/Constants.h"
 #include "foundation/Preferences.h"
@@ -33,6 +34,10 @@ Preferences& CXDConduit::preferences() const {
     return Preferences::shared();
 }
 
+WithdrawalNotice* CXDConduit::withdrawalNotice() const {
+    return nullptr;
+}
+
 void CXDConduit::cancelPublishing(const RemoteLocation& location) {
     removeMarksOfPublication(database());
     database().save();
@@ -49,11 +54,20 @@ void CXDConduit::cancelSharingTo(const RemoteLocation& location) {
 }
 
 void CXDConduit::removeRecordsAssociateWithRemoteLocation(const RemoteLocation& location) {
-    if (_engine.userForRemoteLocation(location) == kSelf)
+    const UserName user = _engine.userForRemoteLocation(location);
+    if (user == kSelf) {
         removeMarksOfPublication(database());
-    else
-        removeCopies(database(), location);
+        database().save();
+        return;
+    }
+    // Without a subscription there is nothing that could leave, and nobody to be told.
+    const bool subscribed = database().findSubscriptionWithRemoteLocation(location) != nullptr;
+    WithdrawalNotice* notice = subscribed ? withdrawalNotice() : nullptr;
+    const auto kept = notice ? notice->keep(database(), location, user) : std::nullopt;
+    if (notice && !kept) return;
+    removeCopies(database(), location);
     database().save();
+    if (kept) notice->tell(*kept);
 }
 
 } // namespace rolvane

@@ -144,9 +144,10 @@ bool CXDConduit::readGroup(const Url& base, const std::string& name, Dictionary&
 
 CXDChangeRecords CXDConduit::comparePriorStateToCurrentState(const Dictionary& prior, const Dictionary& current) {
     CXDChangeRecords records;
-    for (const auto& [user, state] : prior) compareUser(UserName(user), prior, current, records);
-    for (const auto& [user, state] : current)
-        if (!prior.contains(user)) compareUser(UserName(user), prior, current, records);
+    std::vector<std::string> users = prior.allKeys(); // a cancelled user leaves the prior state on the way
+    for (const std::string& user : current.allKeys())
+        if (!prior.contains(user)) users.push_back(user);
+    for (const std::string& user : users) compareUser(UserName(user), prior, current, records);
     return records;
 }
 

@@ -118,6 +118,7 @@ void CXDVaultraConduit::open() {
 void CXDVaultraConduit::close() {
     CXDConduit::close();
     if (_vaultraOffLine) return;
+    _world.manager.saveVersionMemory();
     const std::optional<Date> now = currentServerDate();
     CXDLog("Closing, last sync: %@", now);
     // A store that went away during the pass tells no date: keeping the old one costs reads, a guessed one loses edits.
@@ -166,6 +167,7 @@ void CXDVaultraConduit::warnUserAboutUserNameOrPassword() {
 }
 
 Dictionary CXDVaultraConduit::currentState() {
+    const CXDAVManager::Snapshot unchangedGroupsAreNotFetched(_world.manager);
     return CXDConduit::currentState();
 }
 

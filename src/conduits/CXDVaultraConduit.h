@@ -45,7 +45,8 @@ public:
         DistributedNotifications& distributed; // the user's processes': "SimulateVaultraNotification"
         UserAlert& alert;
         CXRolvane& rolvane;
-        ACLManagerFactory makeACLManager = {}; // none: a CXDAVACLManager on the client
+        ACLManagerFactory makeACLManager = {};   // none: a CXDAVACLManager on the client
+        WithdrawalNotice* withdrawals = nullptr; // none: nothing is kept and nobody is told
     };
 
     CXDVaultraConduit(ConduitEngine& engine, World world);
@@ -87,6 +88,7 @@ protected:
     CXRolvane& database() const override { return _world.rolvane; }
     Preferences& preferences() const override { return _world.preferences; }
     bool keepsAccessLists() const override; // as the server announces it
+    WithdrawalNotice* withdrawalNotice() const override { return _world.withdrawals; }
 
 private:
     void forgetSubscribersRights();

@@ -4,7 +4,7 @@
 
 namespace rolvane {
 
-// A notice that stands until the person has answered it. Exists so that the conduits need no desktop and tests none.
+// Notices to the person at the desktop. Exists so that the conduits need no desktop and tests none.
 class UserAlert {
 public:
     // The alert levels of the platform that the system uses.
@@ -20,6 +20,8 @@ public:
     // Shows the alert and waits, without a time-out of its own, for the answer, which nobody asks for. Where no alert
     // can be shown it returns at once. On the caller's thread; throws nothing.
     virtual void show(const Text& text) = 0;
+    // Shows a notice and returns at once.
+    virtual void tell(const Text& text) = 0;
 };
 
 } // namespace rolvane

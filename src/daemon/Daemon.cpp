@@ -2,6 +2,7 @@
 
 #include "conduits/CXDCXConduit.h"
 #include "conduits/CXDVaultraConduit.h"
+#include "conduits/WithdrawalNotice.h"
 #include "contacts/CXAllGroup.h"
 #include "contacts/CXRolvane.h"
 #include "contacts/CXUserDefaults.h"
@@ -122,9 +123,16 @@ private:
 
     EngineConduits makeConduits(ConduitEngine& engine, CXDAVManager& store) {
         auto vaultra = std::make_unique<CXDVaultraConduit>(
-            engine, CXDVaultraConduit::World{
-                        store, CXNetworkController::sharedNetworkController(), Preferences::shared(), Clock::system(),
-                        NotificationCenter::defaultCenter(), *_bus, _alert, CXRolvane::sharedLocalRolvane()});
+            engine, CXDVaultraConduit::World{store,
+                                             CXNetworkController::sharedNetworkController(),
+                                             Preferences::shared(),
+                                             Clock::system(),
+                                             NotificationCenter::defaultCenter(),
+                                             *_bus,
+                                             _alert,
+                                             CXRolvane::sharedLocalRolvane(),
+                                             {},
+                                             &_withdrawals});
         auto cx = std::make_unique<CXDCXConduit>(engine, CXDCXConduit::World{CXRolvane::sharedLocalRolvane(),
                                                                              Preferences::shared(), Clock::system(),
                                                                              NotificationCenter::defaultCenter()});
@@ -142,6 +150,8 @@ private:
     CXDProgressManager _progress;
     UnixProcessEnd _processEnd;
     DesktopAlert _alert;
+    WithdrawnContactsFolder _withdrawn;
+    WithdrawalNotice _withdrawals{_withdrawn, Clock::system(), _alert};
     std::unique_ptr<NetworkAccount> _account;
     RunLoop::Handle _terminated;
 };

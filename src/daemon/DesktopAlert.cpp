@@ -52,13 +52,30 @@ Slot onSignal(sd_bus* bus, const char* sender, const char* path, const char* int
     return Slot(slot);
 }
 
+using Bus = std::unique_ptr<sd_bus, BusCloser>;
+
+Bus userBus() {
+    sd_bus* raw = nullptr;
+    return Bus(sd_bus_open_user(&raw) < 0 ? nullptr : raw);
+}
+
 } // namespace
+
+void DesktopAlert::tell(const Text& text) {
+    CXLog("%s %s", text.header, text.message);
+    const Bus bus = userBus();
+    if (!bus) return;
+    constexpr uint64_t kPatience = 2000000; // microseconds
+    sd_bus_set_method_call_timeout(bus.get(), kPatience);
+    sd_bus_call_method(bus.get(), kService, kPath, kService, "Notify", nullptr, nullptr, "susssasa{sv}i", "Rolvane", 0u,
+                       text.icon.c_str(), text.header.c_str(), text.message.c_str(), 0, 1, "urgency", "y", 1, -1);
+}
 
 void DesktopAlert::show(const Text& text) {
     CXLog("%s %s", text.header, text.message);
-    sd_bus* raw = nullptr;
-    if (sd_bus_open_user(&raw) < 0) return;
-    const std::unique_ptr<sd_bus, BusCloser> bus(raw);
+    const Bus bus = userBus();
+    if (!bus) return;
+    sd_bus* raw = bus.get();
 
     Answer answer;
     const Slot closed = onSignal(raw, kService, kPath, kService, "NotificationClosed", answered, answer);

@@ -9,6 +9,7 @@ namespace rolvane {
 class DesktopAlert : public UserAlert {
 public:
     void show(const Text& text) override;
+    void tell(const Text& text) override;
 };
 
 } // namespace rolvane

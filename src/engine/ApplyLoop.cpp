@@ -7,6 +7,7 @@
 #include "engine/PublicationCache.h"
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "store/CXFileManager.h"
 
 #include <algorithm>
 #include <charconv>
@@ -40,6 +41,28 @@ int64_t configuredWorkers(const NetworkAccount& account) {
     const auto [end, error] = std::from_chars(text->data(), text->data() + text->size(), workers);
     return error == std::errc() && end == text->data() + text->size() ? workers : kDefaultWorkers;
 }
+
+// Tells the file managers what the apply loop is going to read, and that it has ended.
+class ReadingAhead {
+public:
+    explicit ReadingAhead(const CXDChangeRecords& records) {
+        std::vector<Url> urls;
+        for (const CXDChangeRecordPtr& record : records) {
+            if (!(record->appliesToSources() & CXDSyncSourceCX) || !record->delayedPayloadURL()) continue;
+            if (!_manager) _manager = record->fileManager();
+            if (record->fileManager() == _manager) urls.push_back(*record->delayedPayloadURL());
+        }
+        if (_manager) _manager->expectReads(urls, true); // payloads are read securely
+    }
+    ~ReadingAhead() {
+        if (_manager) _manager->expectReads({}, true);
+    }
+    ReadingAhead(const ReadingAhead&) = delete;
+    ReadingAhead& operator=(const ReadingAhead&) = delete;
+
+private:
+    CXFileManager* _manager = nullptr; // of the network store, the one that a pass reads
+};
 
 } // namespace
 
@@ -126,6 +149,7 @@ void ApplyLoop::applyOutOfOrder() {
 }
 
 void ApplyLoop::applyInOrder() {
+    const ReadingAhead ahead(_inOrder);
     for (; _inOrderDone < _inOrder.size(); ++_inOrderDone) {
         const CXDChangeRecordPtr& record = _inOrder[_inOrderDone];
         applyInOrder(record);
@@ -154,6 +178,7 @@ void ApplyLoop::applyInOrder(const CXDChangeRecordPtr& record) {
 
 bool ApplyLoop::applyTo(CXDConduit& conduit, int32_t source, const CXDChangeRecordPtr& record) {
     if (!conduit.applyChangeRecordIfNeeded(record, &_denied)) return false;
+    if (!conduit.holds(*record)) return true; // done with, but not remembered: the next comparison offers it again
     _parts.state.withConduitData([&](Dictionary& data) { didApplyChange(data, *record, source); });
     return true;
 }

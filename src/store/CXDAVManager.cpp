@@ -182,7 +182,23 @@ bool CXDAVManager::createDirectoryAtAURL(const Url& url) {
 }
 
 std::optional<FileListing> CXDAVManager::infoForFilesInContainer(const Url& url) {
-    return StoreListing(_impl->session, _impl->versions).list(url);
+    auto listing = StoreListing(_impl->session, _impl->versions).list(url);
+    if (listing)
+        for (const auto& [path, file] : *listing)
+            if (file.seen && file.displayName.ends_with("CXGroup"))
+                _impl->files.copies().foundUnchanged(url.cxURLByAppendingComponent(file.displayName).absoluteString());
+    return listing;
+}
+
+void CXDAVManager::expectReads(const std::vector<Url>& urls, bool securely) {
+    _impl->files.expectReads(urls, securely);
+}
+
+CXDAVManager::Snapshot::Snapshot(CXDAVManager& manager) : _impl(manager._impl) {
+    _impl->files.copies().beginSnapshot();
+}
+CXDAVManager::Snapshot::~Snapshot() {
+    _impl->files.copies().endSnapshot();
 }
 
 bool CXDAVManager::sanityCheckPublishStructureCreate(bool create) {

@@ -46,6 +46,7 @@ inline constexpr int kCXDAVErrorNoAccount = -1100; // no account, or one that ca
 // entry.
 class CXDAVManager : public CXFileManager {
 public:
+    struct Impl;                                        // shared with the locks made from this client
     static constexpr const char* kStateName = ".state"; // never a group's, person's or structure file's name
 
     // Where the versions of files are remembered from run to run; empty: in memory only.
@@ -89,6 +90,20 @@ public:
     bool removeDirectoryAndContentsAtURL(const Url& url) override;
     bool createDirectoryAtAURL(const Url& url); // true when it is there afterwards
     std::optional<FileListing> infoForFilesInContainer(const Url& url) override;
+    void expectReads(const std::vector<Url>& urls, bool securely) override;
+
+    // While one lives, dictionaryAtURL of a group whose file is, in a listing made meanwhile, still the version that
+    // this client read or wrote last gives that content without asking the store. One at a time.
+    class Snapshot {
+    public:
+        explicit Snapshot(CXDAVManager& manager);
+        ~Snapshot();
+        Snapshot(const Snapshot&) = delete;
+        Snapshot& operator=(const Snapshot&) = delete;
+
+    private:
+        std::shared_ptr<Impl> _impl;
+    };
 
     // Checks the account's own tree: the tree, "People" and its 32 buckets, "info" with "SerialNumber", "dateFile".
     // One request when all is there. With `create` what is missing is made; nothing that exists is written again.
@@ -116,7 +131,6 @@ public:
     // -- ending: every request under way and every later one fails at once. From any thread or a signal handler.
     void abortAll();
 
-    struct Impl; // shared with the locks made from this client
     const std::shared_ptr<Impl>& impl() const { return _impl; }
 
 private:

@@ -78,6 +78,8 @@ bool CXFileManager::removeDirectoryAndContentsAtURL(const Url& url) {
     return error == 0 || error == ENOENT;
 }
 
+void CXFileManager::expectReads(const std::vector<Url>& /*urls*/, bool /*securely*/) {}
+
 std::optional<FileListing> CXFileManager::infoForFilesInContainer(const Url& url) {
     if (isRemote(url)) return CXDAVManager::defaultManager().infoForFilesInContainer(url);
     FileListing out;

@@ -10,6 +10,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <vector>
 
 namespace rolvane {
 
@@ -17,11 +18,13 @@ class LocalFiles;
 
 // One entry of a container's listing.
 struct FileInfo {
-    std::string displayName;              // the decoded last path component; never used as a local path
-    std::optional<Date> modificationdate; // a remote version that was never read has the listing's own server date
+    std::string displayName; // the decoded last path component; never used as a local path
+    std::optional<Date>
+        modificationdate; // a remote version that was never read: later than the listing, see StoreListing
     uint64_t size = 0;
     EntityTag etag; // empty when the store gives none
     bool isCollection = false;
+    bool seen = false; // remote: this very version was read or written by this client
 };
 // Keyed by path: the decoded path of the entry's URL. Enumerates in byte order of the paths.
 using FileListing = std::map<std::string, FileInfo>;
@@ -45,6 +48,9 @@ public:
     virtual bool write(const std::string& text, const Url& url, bool securely);
     // Absence counts as success.
     virtual bool removeDirectoryAndContentsAtURL(const Url& url);
+    // The dictionaries at these URLs are going to be read, with `securely`, in this order: what can be fetched ahead
+    // is. Each is used for the first reading only. An empty list ends it. Base: nothing is fetched ahead.
+    virtual void expectReads(const std::vector<Url>& urls, bool securely);
     // What lies in the container, complete or nothing. A remote base location also lists the contact files in the
     // buckets below its "People"; other containers list their own entries only. Entries with hostile names are left
     // out, as are local links, pipes and devices.

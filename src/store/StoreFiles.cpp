@@ -14,6 +14,7 @@ namespace {
 
 constexpr std::string_view kMakingSuffix = ".making";
 constexpr size_t kMaxKnownCollections = 20000;
+constexpr int kOk = 200;
 
 // The dictionary that a thread read last, and what its next write to the same place has to find there.
 struct ReadMark {
@@ -87,7 +88,11 @@ std::string contentType(const std::string& text) {
 } // namespace
 
 StoreFiles::StoreFiles(StoreSession& session, LockTokens& tokens, VersionMemory& versions)
-    : _session(session), _tokens(tokens), _versions(versions), _reader(nextReader()) {}
+    : _session(session), _tokens(tokens), _versions(versions),
+      _ahead([&session](HttpRequest request, HttpTransport::Completion done) {
+          session.start(std::move(request), std::move(done));
+      }),
+      _reader(nextReader()) {}
 
 bool StoreFiles::isReservedName(std::string_view name) {
     return name == CXDAVManager::kStateName || name.ends_with(kMakingSuffix);
@@ -112,7 +117,9 @@ void StoreFiles::forget(const Url& url) {
 // ---- reading
 
 StoreFiles::Fetched StoreFiles::fetch(const Url& url, bool mayBeCollection) {
-    HttpResponse answer = _session.send(StoreSession::request("GET", url));
+    std::optional<HttpResponse> waiting = _ahead.take(url);
+    HttpResponse answer =
+        waiting ? _session.judged(std::move(*waiting)) : _session.send(StoreSession::request("GET", url));
     // httpd says 403 of a file that is replaced or removed while it is being opened, too: only what is said twice
     // counts.
     if (answer.status == 403 && !mayBeCollection) answer = _session.send(StoreSession::request("GET", url));
@@ -132,9 +139,10 @@ StoreFiles::Fetched StoreFiles::fetch(const Url& url, bool mayBeCollection) {
             if (const Dictionary* d = value.dictionaryIf()) {
                 out.dictionary = *d;
                 out.found = Found::dictionary;
-            }
+            } else
+                CXLog("What lies at %@ is no dictionary and is left out.", url);
         } catch (const CXException& e) {
-            CXDLog("No dictionary at %@: %@", url, e.reason());
+            CXLog("What lies at %@ is no dictionary and is left out: %@", url, e.reason());
         }
     }
     return out;
@@ -191,9 +199,11 @@ void StoreFiles::note(const Url& name, const Url& target, const Fetched& fetched
     if (fetched.found == Found::absent) {
         mark.state = ReadMark::State::absent;
         _versions.forget(name.absoluteString());
+        _copies.forget(name.absoluteString());
     } else if (fetched.found == Found::dictionary) {
         mark.state = ReadMark::State::present;
         _versions.read(name.absoluteString(), fetched.version);
+        if (mayBeBoth(name)) _copies.keep(name.absoluteString(), *fetched.dictionary);
     } else if (fetched.found == Found::noDictionary) {
         mark.state = ReadMark::State::present; // and its version stays unseen: nobody has learnt what it says
     }
@@ -202,6 +212,8 @@ void StoreFiles::note(const Url& name, const Url& target, const Fetched& fetched
 
 StoreFiles::Reading StoreFiles::read(const Url& name, bool securely) {
     lastReads.erase(_reader);
+    if (mayBeBoth(name))
+        if (auto unchanged = _copies.unchanged(name.absoluteString())) return {kOk, std::move(unchanged)};
     const auto url = _session.endpoint(name, securely);
     if (!url) return {};
     Url target = *url;
@@ -209,6 +221,14 @@ StoreFiles::Reading StoreFiles::read(const Url& name, bool securely) {
     if (mayBeBoth(name) && fetched.found == Found::noDictionary) fetched = confirmed(fetched, target);
     note(name, target, fetched);
     return {fetched.code, std::move(fetched.dictionary)};
+}
+
+void StoreFiles::expectReads(const std::vector<Url>& names, bool securely) {
+    std::vector<Url> urls;
+    urls.reserve(names.size());
+    for (const Url& name : names)
+        if (const auto url = _session.endpoint(name, securely)) urls.push_back(*url);
+    _ahead.expect(urls);
 }
 
 std::optional<Date> StoreFiles::modificationDate(const Url& name) {
@@ -228,6 +248,15 @@ std::optional<Date> StoreFiles::modificationDate(const Url& name) {
 
 // ---- writing
 
+void StoreFiles::keepWritten(const Url& name, const std::string& text) {
+    _copies.forget(name.absoluteString());
+    try {
+        const Value written = PropertyList::fromXML(text);
+        if (const Dictionary* content = written.dictionaryIf()) _copies.keep(name.absoluteString(), *content);
+    } catch (const CXException&) { // no dictionary: nothing that could be read back
+    }
+}
+
 int StoreFiles::put(const Url& name, const Url& target, const std::shared_ptr<const std::string>& body,
                     std::vector<std::pair<std::string, std::string>> headers) {
     HttpRequest request = StoreSession::request("PUT", target);
@@ -235,11 +264,13 @@ int StoreFiles::put(const Url& name, const Url& target, const std::shared_ptr<co
     request.headers = std::move(headers);
     request.body = body;
     const HttpResponse answer = _session.send(std::move(request));
+    _ahead.forget(target);
     if (answer.ok()) {
         const std::string* tag = answer.header("etag");
         const std::string* date = answer.header("date");
         _versions.wrote(name.absoluteString(), tag ? EntityTag(*tag) : EntityTag(),
                         date ? Date::fromHTTP(*date) : std::nullopt, body->size());
+        if (mayBeBoth(name)) keepWritten(name, *body);
     }
     return answer.status;
 }
@@ -276,6 +307,8 @@ int StoreFiles::remove(const Url& name) {
     if (!url) return 0;
     forget(*url);
     _versions.forget(name.absoluteString());
+    _copies.forget(name.absoluteString());
+    _ahead.forget(*url);
     HttpRequest request = StoreSession::request("DELETE", *url);
     const LockToken token = _tokens.tokenFor(url->absoluteString());
     if (!token.empty()) request.headers.emplace_back("If", taggedCondition(*url, "<" + token.str() + ">"));

@@ -1,7 +1,9 @@
 #pragma once
 
 #include "foundation/Value.h"
+#include "store/GroupCopies.h"
 #include "store/LockTokens.h"
+#include "store/ReadAhead.h"
 #include "store/StoreSession.h"
 #include "store/VersionMemory.h"
 
@@ -10,6 +12,7 @@
 #include <optional>
 #include <string>
 #include <unordered_set>
+#include <vector>
 
 namespace rolvane {
 
@@ -25,6 +28,10 @@ public:
         std::optional<Dictionary> dictionary;
     };
     Reading read(const Url& name, bool securely);
+    // These are going to be read, in this order (see ReadAhead).
+    void expectReads(const std::vector<Url>& names, bool securely);
+    // The groups' dictionaries whose version is the one that this client knows; consulted by `read` during a snapshot.
+    GroupCopies& copies() { return _copies; }
     // `repair` is called when a folder on the way to the file is missing; true: worth another try.
     int write(const Url& name, std::string text, bool securely, const std::function<bool()>& repair = {});
     int remove(const Url& name);
@@ -50,6 +57,7 @@ private:
     Fetched confirmed(const Fetched& once, const Url& target);
     void note(const Url& name, const Url& target, const Fetched& fetched);
 
+    void keepWritten(const Url& name, const std::string& text);
     int put(const Url& name, const Url& target, const std::shared_ptr<const std::string>& body,
             std::vector<std::pair<std::string, std::string>> headers);
     enum class Kind { absent, file, collection, unknown };
@@ -63,6 +71,8 @@ private:
     StoreSession& _session;
     LockTokens& _tokens;
     VersionMemory& _versions;
+    ReadAhead _ahead;
+    GroupCopies _copies;
     const uint64_t _reader;                       // tells this object from every other one of the process
     mutable std::mutex _mutex;                    // guards _collections
     std::unordered_set<std::string> _collections; // endpoints known to be collections; a cache

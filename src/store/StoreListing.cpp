@@ -3,6 +3,8 @@
 #include "foundation/Log.h"
 #include "store/StoreFiles.h"
 
+#include <algorithm>
+
 namespace rolvane {
 
 namespace {
@@ -89,10 +91,10 @@ void StoreListing::stamp(const Url& name, const MultistatusEntry& entry, const s
     info.size = entry.length.value_or(0);
     info.etag = entry.etag;
     info.modificationdate = entry.lastModified;
-    if (!entry.lastModified || !serverDate || *serverDate < *entry.lastModified) return;
-    // A version that was never read counts as of now, so that nobody takes it for an old one.
-    if (!_versions.knows(name.absoluteString(), {entry.etag, entry.lastModified, info.size}))
-        info.modificationdate = serverDate;
+    info.seen = _versions.knows(name.absoluteString(), {entry.etag, entry.lastModified, info.size});
+    // Only with both dates is it known what "now" is to the server; its files may be dated ahead of its clock.
+    if (!info.seen && entry.lastModified && serverDate)
+        info.modificationdate = std::max(*entry.lastModified, *serverDate).addingSeconds(kUnseenSeconds);
 }
 
 bool StoreListing::addEntries(const Members& members, FileListing& out, std::vector<Url>& groupCollections) {

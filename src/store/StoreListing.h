@@ -15,6 +15,11 @@ class StoreListing {
 public:
     StoreListing(StoreSession& session, VersionMemory& versions) : _session(session), _versions(versions) {}
 
+    // How much later than the listing a version is dated that this client has neither read nor written: whoever
+    // compares with the date of the last sync leaves a margin, and the version must lie behind that in this very
+    // listing.
+    static constexpr double kUnseenSeconds = 5;
+
     // As CXFileManager::infoForFilesInContainer.
     std::optional<FileListing> list(const Url& container);
     // The names of the direct members of each container, with what they are. Nothing for a container that cannot be

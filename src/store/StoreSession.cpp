@@ -151,6 +151,13 @@ std::vector<HttpResponse> StoreSession::sendAll(std::vector<HttpRequest> request
     return answers;
 }
 
+void StoreSession::start(HttpRequest request, HttpTransport::Completion done) {
+    if (signIn()) return _transport->start(std::move(request), std::move(done));
+    HttpResponse unsent;
+    unsent.error = TransportError::refused;
+    done(std::move(unsent));
+}
+
 HttpResponse StoreSession::options() {
     const auto base = endpoint(_account.baseLocationFor(_account.user));
     if (!base) return {};

@@ -34,6 +34,9 @@ public:
     // Sends the request. A 403 or 404 is believed only from a WebDAV server: otherwise the answer is an `unreachable`.
     HttpResponse send(HttpRequest request);
     std::vector<HttpResponse> sendAll(std::vector<HttpRequest> requests);
+    // Sends it and calls back with the answer as it came; whoever uses that has it judged then, on its own thread.
+    void start(HttpRequest request, HttpTransport::Completion done);
+    HttpResponse judged(HttpResponse answer);
 
     // Whether the store can be used, see CXDAVManager::canReachOstrelError.
     bool canReach(CXDAVError& error);
@@ -48,7 +51,6 @@ public:
 
 private:
     bool signIn();
-    HttpResponse judged(HttpResponse answer);
     bool isDavServer();
     HttpResponse options();
     CXDAVError errorFrom(const HttpResponse& answer, const char* asked) const;

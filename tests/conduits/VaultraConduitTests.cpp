@@ -30,6 +30,8 @@ struct SwitchedNetwork : CXNetworkController {
 
 struct RecordedAlert : UserAlert {
     void show(const Text& text) override { shown.push_back(text); }
+    void tell(const Text& text) override { told.push_back(text); }
+    std::vector<Text> told;
     std::vector<Text> shown;
 };
 

@@ -208,7 +208,7 @@ TEST(HostileStore, AVersionThatCouldNotBeUnderstoodStaysUnseen) {
     s.manager->dictionaryAtURL(s.base.cxURLByAppendingComponent("x"), false, nullptr);
     const auto listing = s.manager->infoForFilesInContainer(s.base);
     ASSERT_TRUE(listing);
-    EXPECT_EQ(listing->begin()->second.modificationdate->toHTTP(), "Sat, 21 Nov 2026 10:00:00 GMT");
+    EXPECT_EQ(listing->begin()->second.modificationdate->toHTTP(), "Sat, 21 Nov 2026 10:00:05 GMT");
 }
 
 TEST(HostileStore, NamesOfAnotherStoreAreNeverAskedFor) {
@@ -283,12 +283,12 @@ TEST(HostileStore, AVersionStaysUnseenUntilItIsRead) {
     const auto date = [&] {
         return s.manager->infoForFilesInContainer(s.base)->begin()->second.modificationdate->toHTTP();
     };
-    EXPECT_EQ(date(), "Sat, 21 Nov 2026 10:00:00 GMT");
-    EXPECT_EQ(date(), "Sat, 21 Nov 2026 10:00:00 GMT") << "listing is not reading";
+    EXPECT_EQ(date(), "Sat, 21 Nov 2026 10:00:05 GMT");
+    EXPECT_EQ(date(), "Sat, 21 Nov 2026 10:00:05 GMT") << "listing is not reading";
     s.manager->dictionaryAtURL(group, false, nullptr);
     EXPECT_EQ(date(), "Fri, 20 Nov 2026 23:48:00 GMT");
     tag = "\"2\"";
-    EXPECT_EQ(date(), "Sat, 21 Nov 2026 10:00:00 GMT");
+    EXPECT_EQ(date(), "Sat, 21 Nov 2026 10:00:05 GMT");
 }
 
 TEST(HostileStore, APasswordThatCannotBeHadIsTold) {
