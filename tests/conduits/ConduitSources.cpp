@@ -203,6 +203,7 @@ struct AlwaysUp : CXNetworkController {
 };
 struct NoAlert : UserAlert {
     void show(const Text&) override {}
+    void tell(const Text&) override {}
 };
 
 class NetworkSource : public Source {
