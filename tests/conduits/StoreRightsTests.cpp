@@ -21,6 +21,7 @@ struct AlwaysUp : CXNetworkController {
 };
 struct NoAlert : UserAlert {
     void show(const Text&) override {}
+    void tell(const Text&) override {}
 };
 
 // The network store's conduit of alice, over a store that keeps access lists; bob publishes there, too.
