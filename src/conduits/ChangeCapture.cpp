@@ -151,14 +151,16 @@ bool ChangeCapture::cameFromPublisher(const CXRow& person) const {
 // Many new members: the data of those that are not captured yet is read together, so that announcing them finds it
 // here.
 void ChangeCapture::readNewMembers(const GroupSteps& steps, const CXGroup& group) {
-    std::unordered_set<UniqueId> wanted;
-    for (const GroupStep& step : steps)
-        if (const auto* member = std::get_if<CaptureMember>(&step)) wanted.insert(member->person);
-    if (wanted.size() < kFew) return;
+    size_t added = 0;
+    for (const GroupStep& step : steps) added += std::holds_alternative<CaptureMember>(step) ? 1 : 0;
+    if (added < kFew) return;
     _reader.learnSubscribedPeople();
-    std::erase_if(wanted, [this](const UniqueId& member) {
-        return _people.contains(_reader.knownPersonFor(member).value_or(member));
-    });
+    std::unordered_set<UniqueId> wanted;
+    for (const GroupStep& step : steps) {
+        const auto* member = std::get_if<CaptureMember>(&step);
+        if (member && !_people.contains(_reader.knownPersonFor(member->person).value_or(member->person)))
+            wanted.insert(member->person);
+    }
     if (wanted.size() < kFew || wanted.size() * kRowsPerLookup < group.memberCount()) return;
     _reader.expectMany();
     _reader.forEachMember(group, wanted, [this](const CXRow& row) {

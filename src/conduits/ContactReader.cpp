@@ -79,7 +79,7 @@ std::optional<CXRow> ContactReader::personForUniqueId(const UniqueId& uid) const
 std::optional<UniqueId> ContactReader::knownPersonFor(const UniqueId& uid) const {
     if (uid.endsWith(kCXSubscribedPersonTable)) return uid;
     if (!_subscribedPeople) return std::nullopt;
-    const bool hasCopy = _subscribedPeople->contains(std::string(cxUUIDPart(uid)));
+    const bool hasCopy = !_subscribedPeople->empty() && _subscribedPeople->contains(std::string(cxUUIDPart(uid)));
     return cxUIDWithTableName(uid, hasCopy ? kCXSubscribedPersonTable : kCXPersonTable);
 }
 
@@ -88,7 +88,8 @@ void ContactReader::forEachMember(const CXGroup& group, const std::unordered_set
     const auto& subscribed = subscribedPeople();
     _rolvane.forEachMember(group, [&](const CXRow& row) {
         if (!wanted.contains(cxNormalizedUID(row.sharingUniqueId))) return;
-        const bool hidden = !cxIsSubscribed(row.uniqueId) && subscribed.contains(std::string(cxUUIDPart(row.uniqueId)));
+        const bool hidden = !subscribed.empty() && !cxIsSubscribed(row.uniqueId) &&
+                            subscribed.contains(std::string(cxUUIDPart(row.uniqueId)));
         if (!hidden) call(row);
     });
 }
@@ -96,9 +97,8 @@ void ContactReader::forEachMember(const CXGroup& group, const std::unordered_set
 const std::unordered_set<std::string>& ContactReader::subscribedPeople() {
     if (!_subscribedPeople) {
         _subscribedPeople.emplace();
-        _rolvane.forEachPersonModifiedSince(Date::distantPast(), kCXSubscribedPersonTable, [this](const CXRow& row) {
-            _subscribedPeople->emplace(cxUUIDPart(row.uniqueId));
-        });
+        for (const UniqueId& person : _rolvane.peopleOfTable(kCXSubscribedPersonTable))
+            _subscribedPeople->emplace(cxUUIDPart(person));
     }
     return *_subscribedPeople;
 }

@@ -7,6 +7,11 @@
 namespace rolvane {
 namespace {
 
+UniqueId identifierIn(const Value& element) { // shares the text
+    const SharedText* text = element.textIf();
+    return text ? UniqueId(*text) : UniqueId();
+}
+
 // Collects the records and the places of one comparison.
 class Comparison {
 public:
@@ -24,12 +29,12 @@ public:
     void members() {
         const Dictionary differences = differencesOf(kMemberUIDState);
         for (const Value& added : differences[kAdditions].array()) {
-            const UniqueId member(added.string());
+            const UniqueId member = identifierIn(added);
             _steps.push_back(CaptureMember{member});
             add(CXDAddRecordToGroup, member, _address.guid);
         }
         for (const Value& removed : differences[kDeletions].array()) {
-            const UniqueId member(removed.string());
+            const UniqueId member = identifierIn(removed);
             // Whoever leaves the all-contacts group has left the database.
             if (_isAllGroup) add(CXDDeleteRecord, member, {});
             add(CXDRemoveRecordFromGroup, member, _address.guid);
@@ -40,12 +45,12 @@ public:
     void subgroups() {
         const Dictionary differences = differencesOf(kSubgroupUIDState);
         for (const Value& added : differences[kAdditions].array()) {
-            const UniqueId subgroup(added.string());
+            const UniqueId subgroup = identifierIn(added);
             _steps.push_back(CaptureSubgroup{subgroup});
             add(CXDAddGroupToGroup, subgroup, _address.guid);
         }
         for (const Value& removed : differences[kDeletions].array()) {
-            const UniqueId subgroup(removed.string());
+            const UniqueId subgroup = identifierIn(removed);
             if (_isAllGroup) add(CXDDeleteGroup, {}, subgroup);
             add(CXDRemoveGroupFromGroup, subgroup, _address.guid);
         }

@@ -228,13 +228,43 @@ std::optional<CXRow> CXRolvane::personRow(const UniqueId& uid) {
     return _impl->row(uid, true);
 }
 
+std::vector<UniqueId> CXRolvane::peopleOfTable(std::string_view table) {
+    RecordKind wanted = kindOfTable(table);
+    if (!isPerson(wanted)) throw CXException(kCXInvalidArgumentException, std::string(table) + " holds no people.");
+    std::lock_guard lock(_impl->mutex);
+    return _impl->recordsOf(wanted, std::nullopt);
+}
+
 void CXRolvane::forEachMember(const CXGroup& group, const std::function<void(const CXRow&)>& call) {
-    for (const UniqueId& uid : group.memberUniqueIds()) {
-        std::unique_lock lock(_impl->mutex);
-        std::optional<CXRow> row = _impl->row(uid, true);
-        lock.unlock();
-        if (row) call(*row);
+    std::unique_lock lock(_impl->mutex);
+    if (!_impl->work.empty()) { // the list itself may have unsaved changes
+        std::vector<UniqueId> members = group.memberUniqueIds();
+        for (const UniqueId& uid : members) {
+            std::optional<CXRow> row = _impl->row(uid, true);
+            lock.unlock();
+            if (row) call(*row);
+            lock.lock();
+        }
+        return;
     }
+    if (!group.isAttached()) return;
+    const RecordKind kind = _impl->kind(group.uniqueId());
+    const bool isAll = !isPlainGroup(kind);
+    const RecordKind people = group.isSubscribed() ? RecordKind::subscribedPerson : RecordKind::person;
+    const auto location = group.isSubscribed() ? std::optional(group.remoteLocation().str()) : std::nullopt;
+    int64_t position = 0;
+    std::vector<CXRow> rows;
+    do {
+        rows = isAll ? _impl->store.scanByAge(people, location, position, kPage)
+                     : _impl->store.scanMembers(group.uniqueId(), position, kPage);
+        for (const CXRow& stored : rows) {
+            // The callback may have changed something meanwhile.
+            const std::optional<CXRow> row = _impl->work.empty() ? stored : _impl->row(stored.uniqueId, true);
+            lock.unlock();
+            if (row) call(*row);
+            lock.lock();
+        }
+    } while (rows.size() == kPage);
 }
 
 std::vector<CXRecordRef> CXRolvane::recordsMatchingSearchElement(const CXSearchElement& element) {

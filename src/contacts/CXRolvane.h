@@ -102,7 +102,10 @@ public:
     void forEachPersonModifiedSince(Date date, std::string_view table, const std::function<void(const CXRow&)>& call);
     // One row, null when there is none: a lookup by index.
     std::optional<CXRow> personRow(const UniqueId& uid);
-    // The rows of a group's members, in member order, in pages.
+    // Identifiers of all people of the table, oldest first: one query.
+    std::vector<UniqueId> peopleOfTable(std::string_view table);
+    // The rows of a group's members, in member order, in pages. What the callback changes in the membership may or may
+    // not be seen.
     void forEachMember(const CXGroup& group, const std::function<void(const CXRow&)>& call);
     // People of one location (empty: the owner's own; nothing: all) in display order; with a text, only those whose
     // names, organisation, mails or phones contain it (letter case does not matter).

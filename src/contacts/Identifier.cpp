@@ -38,6 +38,7 @@ std::string_view cxUUIDPart(const UniqueId& uid) {
 }
 
 UniqueId cxUIDWithTableName(const UniqueId& uid, std::string_view table) {
+    if (!table.empty() && cxTableName(uid) == table && !isAllTable(table)) return uid; // shares the text
     bool hasUUID = !isAllTable(uid.str());
     if (isAllTable(cxTableName(uid)) && isGroupTable(table)) {
         std::string all(kAllPrefix.substr(0, 3));

@@ -3,7 +3,9 @@
 #include "foundation/Paths.h"
 #include "foundation/PropertyList.h"
 
+#include <algorithm>
 #include <chrono>
+#include <map>
 #include <thread>
 
 namespace rolvane {
@@ -28,7 +30,7 @@ CREATE TABLE records(
   properties BLOB NOT NULL,
   writer TEXT NOT NULL DEFAULT '');
 CREATE INDEX records_modified ON records(kind, modified);
-CREATE INDEX records_location ON records(kind, location);
+CREATE INDEX records_location ON records(kind, location, id, uid);
 CREATE TABLE listed(
   group_id INTEGER NOT NULL REFERENCES records(id) ON DELETE CASCADE,
   position INTEGER NOT NULL,
@@ -75,6 +77,23 @@ std::vector<std::pair<int64_t, UniqueId>> numbered(Sqlite::Statement& s) {
     return all;
 }
 
+bool isOlder(const std::pair<int64_t, UniqueId>& a, const std::pair<int64_t, UniqueId>& b) {
+    return a.first < b.first;
+}
+
+// Of "id, uid, location, created, modified, properties, writer".
+CXRow rowOf(Sqlite::Statement& s) {
+    CXRow row;
+    row.uniqueId = UniqueId(s.text(1));
+    row.sharingUniqueId = cxNormalizedUID(row.uniqueId);
+    row.location = RemoteLocation(s.text(2));
+    row.created = Date(s.real(3));
+    row.modified = Date(s.real(4));
+    row.encoded = std::make_shared<const Bytes>(s.bytes(5));
+    row.writer = s.text(6);
+    return row;
+}
+
 } // namespace
 
 RecordStore::RecordStore(Sqlite& database) : _database(database) {
@@ -110,7 +129,9 @@ void RecordStore::makeOrCheckFormat() {
 int64_t RecordStore::addWriters() {
     SqliteTransaction transaction(_database);
     if (_database.integer("PRAGMA user_version") == 1) // nobody else did it meanwhile
-        _database.execute("ALTER TABLE records ADD COLUMN writer TEXT NOT NULL DEFAULT ''; PRAGMA user_version=2;");
+        _database.execute(
+            "ALTER TABLE records ADD COLUMN writer TEXT NOT NULL DEFAULT ''; DROP INDEX records_location; "
+            "CREATE INDEX records_location ON records(kind, location, id, uid); PRAGMA user_version=2;");
     transaction.commit();
     return _database.integer("PRAGMA user_version");
 }
@@ -186,11 +207,15 @@ std::optional<UniqueId> RecordStore::firstOfLocation(RecordKind kind, std::strin
 
 std::vector<std::pair<int64_t, UniqueId>> RecordStore::recordsOf(RecordKind kind,
                                                                  const std::optional<std::string>& location) {
-    auto s = _database.statement(location ? "SELECT id, uid FROM records WHERE kind=?1 AND location=?2 ORDER BY id"
-                                          : "SELECT id, uid FROM records WHERE kind=?1 ORDER BY id");
+    // Read from the index alone, so that listing everybody does not walk over everybody's data.
+    auto s = _database.statement(
+        location ? "SELECT id, uid FROM records INDEXED BY records_location WHERE kind=?1 AND location=?2"
+                 : "SELECT id, uid FROM records INDEXED BY records_location WHERE kind=?1");
     s.bind(1, static_cast<int>(kind));
     if (location) s.bind(2, std::string_view(*location));
-    return numbered(s);
+    auto all = numbered(s);
+    if (!std::is_sorted(all.begin(), all.end(), isOlder)) std::sort(all.begin(), all.end(), isOlder);
+    return all;
 }
 
 std::vector<UniqueId> RecordStore::listed(const UniqueId& group, bool groups) {
@@ -286,17 +311,9 @@ std::vector<CXRow> RecordStore::scan(RecordKind kind, ScanPosition& position, in
     const double date = position.modified;
     const auto take = [&](Sqlite::Statement& s) {
         while (s.step()) {
-            CXRow row;
-            row.uniqueId = UniqueId(s.text(1));
-            row.sharingUniqueId = cxNormalizedUID(row.uniqueId);
-            row.location = RemoteLocation(s.text(2));
-            row.created = Date(s.real(3));
-            row.modified = Date(s.real(4));
-            row.encoded = std::make_shared<const Bytes>(s.bytes(5));
-            row.writer = s.text(6);
             position = {s.real(4), s.integer(0)};
             ids.push_back(position.id);
-            rows.push_back(std::move(row));
+            rows.push_back(rowOf(s));
         }
     };
     auto sameDate = _database.statement("SELECT id, uid, location, created, modified, properties, writer FROM records "
@@ -311,13 +328,56 @@ std::vector<CXRow> RecordStore::scan(RecordKind kind, ScanPosition& position, in
     return rows;
 }
 
+std::vector<CXRow> RecordStore::scanMembers(const UniqueId& group, int64_t& position, int limit) {
+    SqliteSnapshot snapshot(_database);
+    auto s = _database.statement(
+        "SELECT r.id, r.uid, r.location, r.created, r.modified, r.properties, r.writer, l.position "
+        "FROM listed l CROSS JOIN records r ON r.id=l.member_id WHERE l.group_id=(SELECT id FROM records WHERE uid=?1) "
+        "AND l.position>?2 AND r.kind IN (1,2) ORDER BY l.position LIMIT ?3");
+    s.bind(1, group.str()).bind(2, position).bind(3, limit);
+    return rowsWithParents(s, 7, position);
+}
+
+std::vector<CXRow> RecordStore::scanByAge(RecordKind kind, const std::optional<std::string>& location,
+                                          int64_t& position, int limit) {
+    SqliteSnapshot snapshot(_database);
+    auto s = _database.statement(
+        location ? "SELECT id, uid, location, created, modified, properties, writer FROM records INDEXED BY "
+                   "records_location "
+                   "WHERE kind=?1 AND location=?4 AND id>?2 ORDER BY id LIMIT ?3"
+                 : "SELECT id, uid, location, created, modified, properties, writer FROM records NOT INDEXED "
+                   "WHERE kind=?1 AND id>?2 ORDER BY id LIMIT ?3");
+    s.bind(1, static_cast<int>(kind)).bind(2, position).bind(3, limit);
+    if (location) s.bind(4, std::string_view(*location));
+    return rowsWithParents(s, 0, position);
+}
+
+std::vector<CXRow> RecordStore::rowsWithParents(Sqlite::Statement& s, int positionColumn, int64_t& position) {
+    std::vector<CXRow> rows;
+    std::vector<int64_t> ids;
+    while (s.step()) {
+        position = s.integer(positionColumn);
+        ids.push_back(s.integer(0));
+        rows.push_back(rowOf(s));
+    }
+    addParents(rows, ids);
+    return rows;
+}
+
+// One query for all rows: their numbers go in as a list.
 void RecordStore::addParents(std::vector<CXRow>& rows, const std::vector<int64_t>& ids) {
-    auto s = _database.statement("SELECT g.uid FROM listed l JOIN records g ON g.id=l.group_id "
-                                 "WHERE l.member_id=? ORDER BY l.group_id");
-    for (size_t i = 0; i < rows.size(); i++) {
-        s.bind(1, ids[i]);
-        while (s.step()) rows[i].parentGroups.emplace_back(s.text(0));
-        s.reset();
+    if (ids.empty()) return;
+    std::string list = "[";
+    for (const int64_t id : ids) list.append(std::to_string(id)).append(",");
+    list.back() = ']';
+    auto s = _database.statement("SELECT e.key, g.id, g.uid FROM json_each(?1) e CROSS JOIN listed l ON "
+                                 "l.member_id=e.value CROSS JOIN records g ON g.id=l.group_id ORDER BY 1, 2");
+    s.bind(1, std::string_view(list));
+    std::map<int64_t, UniqueId> groups; // few: their texts are shared by all rows
+    while (s.step()) {
+        UniqueId& group = groups[s.integer(1)];
+        if (group.empty()) group = UniqueId(s.text(2));
+        rows[static_cast<size_t>(s.integer(0))].parentGroups.push_back(group);
     }
 }
 

@@ -62,6 +62,11 @@ public:
     std::optional<std::string> choice(const UniqueId& group, const UniqueId& person, std::string_view property);
     // Rows of the kind behind the position, by modification date; moves the position. With the parents, if wanted.
     std::vector<CXRow> scan(RecordKind kind, ScanPosition& position, int limit, bool withParents);
+    // Rows with their parents: people that the group lists, in list order, behind the position in the list; or records
+    // of the kind (and location) behind the row number, by age. Both move the position; 0 is before all.
+    std::vector<CXRow> scanMembers(const UniqueId& group, int64_t& position, int limit);
+    std::vector<CXRow> scanByAge(RecordKind kind, const std::optional<std::string>& location, int64_t& position,
+                                 int limit);
     // Calls with uid, location, display, sort and search text of every row of the kind.
     struct Line {
         UniqueId uid;
@@ -89,6 +94,7 @@ private:
     void makeOrCheckFormat();
     int64_t addWriters(); // the format then
     void fillNewDatabase();
+    std::vector<CXRow> rowsWithParents(Sqlite::Statement& s, int positionColumn, int64_t& position);
     void addParents(std::vector<CXRow>& rows, const std::vector<int64_t>& ids);
 
     Sqlite& _database;

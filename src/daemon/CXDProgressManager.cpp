@@ -3,8 +3,10 @@
 namespace rolvane {
 
 void CXDProgressManager::setEngine(const RecordLocator* locator, const LocationOwner* owner) {
+    const std::lock_guard lock(_mutex);
     _locator = locator;
     _owner = owner;
+    _places.clear();
 }
 
 void CXDProgressManager::startedPhase(int32_t phase) {
@@ -17,35 +19,43 @@ void CXDProgressManager::startedPhase(int32_t phase) {
             _didProcessCounts.clear();
         }
         _currentPhase = phase;
+        _places.clear();
     }
     if (first) _notifications.post({"CXDStartedSyncingNotification", std::nullopt, {}});
 }
 
+CXDProgressManager::Place& CXDProgressManager::placeOf(const CXDChangeRecord& record) {
+    const auto [found, isNew] = _places.try_emplace({record.initialSource(), record.appliesToSources(), record.user()});
+    if (isNew && _locator) found->second.location = record.remoteLocation(*_locator);
+    return found->second;
+}
+
 // A record without a remote location is counted nowhere.
 void CXDProgressManager::willProcessChangeRecord(const CXDChangeRecordPtr& record) {
-    const auto location = _locator ? record->remoteLocation(*_locator) : std::nullopt;
-    if (!location) return;
     const std::lock_guard lock(_mutex);
-    ++_willProcessCounts[*location];
+    if (const auto& location = placeOf(*record).location) ++_willProcessCounts[*location];
 }
 
 void CXDProgressManager::didProcessChangeRecord(const CXDChangeRecordPtr& record) {
-    const auto location = _locator ? record->remoteLocation(*_locator) : std::nullopt;
-    if (!location) return;
-    int64_t will = 0, did = 0;
+    std::string shown;
+    double progress = 0;
     {
         const std::lock_guard lock(_mutex);
-        const auto announced = _willProcessCounts.find(*location);
-        will = announced == _willProcessCounts.end() ? 0 : announced->second;
-        did = ++_didProcessCounts[*location];
+        Place& place = placeOf(*record);
+        if (!place.location) return;
+        const auto announced = _willProcessCounts.find(*place.location);
+        const int64_t will = announced == _willProcessCounts.end() ? 0 : announced->second;
+        const int64_t did = ++_didProcessCounts[*place.location];
+        if (will == 0) return;
+        progress = static_cast<double>(did) / static_cast<double>(will);
+        if (!place.shown) {
+            const bool own = _owner && _owner->userForRemoteLocation(*place.location) == kSelf;
+            place.shown = own ? "local" : place.location->str();
+        }
+        shown = *place.shown;
     }
-    if (will == 0) return;
-    const bool own = _owner && _owner->userForRemoteLocation(*location) == kSelf;
-    const std::string shown = own ? "local" : location->str();
     _notifications.post(
-        {"CXDSyncProgressNotification",
-         std::nullopt,
-         {{"progress", static_cast<double>(did) / static_cast<double>(will)}, {"remoteLocation", shown}}});
+        {"CXDSyncProgressNotification", std::nullopt, {{"progress", progress}, {"remoteLocation", shown}}});
 }
 
 void CXDProgressManager::stop() {

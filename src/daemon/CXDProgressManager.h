@@ -8,6 +8,9 @@
 #include <cstdint>
 #include <map>
 #include <mutex>
+#include <optional>
+#include <string>
+#include <tuple>
 
 namespace rolvane {
 
@@ -29,11 +32,21 @@ public:
     int32_t currentPhase() const;
 
 private:
+    // Where records of the same sources and user live, and what progress there is called: asked for once a phase,
+    // because a pass has many records of few places.
+    using Origin = std::tuple<int32_t, int32_t, std::optional<UserName>>; // initial source, applies-to mask, user
+    struct Place {
+        std::optional<RemoteLocation> location;
+        std::optional<std::string> shown;
+    };
+    Place& placeOf(const CXDChangeRecord& record); // with _mutex held
+
     DistributedNotifications& _notifications;
     const RecordLocator* _locator = nullptr;
     const LocationOwner* _owner = nullptr;
     mutable std::mutex _mutex;
     int32_t _currentPhase = 0;
+    std::map<Origin, Place> _places;
     std::map<RemoteLocation, int64_t> _willProcessCounts;
     std::map<RemoteLocation, int64_t> _didProcessCounts;
 };

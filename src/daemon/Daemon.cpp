@@ -12,6 +12,7 @@
 #include "daemon/InstanceLock.h"
 #include "daemon/TerminationWatch.h"
 #include "engine/CXDSyncEngine.h"
+#include "foundation/FreeMemory.h"
 #include "foundation/Log.h"
 #include "foundation/Paths.h"
 #include "store/CXDAVManager.h"
@@ -160,6 +161,7 @@ private:
 
 int runDaemon(int argc, char** argv) {
     constexpr double kTerminationGrace = 4.5; // seconds; the promise is five
+    shareHeaps();
     const TerminationWatch watch([] { termination().ask(); }, kTerminationGrace);
     try {
         Daemon daemon;

@@ -125,8 +125,7 @@ void ApplyLoop::queue() {
     CXDChangeRecords accepted = mingled(_unhandled);
     CXDLog("Mingled: %@", accepted);
     CXDChangeRecords flat = flattenGroupChanges(accepted);
-    std::stable_sort(flat.begin(), flat.end(),
-                     [](const CXDChangeRecordPtr& a, const CXDChangeRecordPtr& b) { return a->compare(*b) < 0; });
+    sortByType(flat);
     _totalCount = flat.size();
     _processedCount = 0;
     CXDLog("Flat: %@", flat);

@@ -7,6 +7,7 @@
 #include "engine/PayloadMerging.h"
 #include "engine/PublicationCache.h"
 #include "foundation/CXException.h"
+#include "foundation/FreeMemory.h"
 #include "foundation/Log.h"
 
 #include <filesystem>
@@ -179,6 +180,7 @@ void CXDSyncEngine::bringSourcesUpToDateAndAllowRetry(bool allowRetry) {
         }
         apply(std::move(gathered), false, allowRetry);
         _parts->with.progress.stop();
+        returnFreeMemory();
     });
 }
 

@@ -4,6 +4,9 @@
 #include "foundation/Log.h"
 
 #include <algorithm>
+#include <cstdint>
+#include <iterator>
+#include <map>
 #include <unordered_map>
 #include <vector>
 
@@ -25,8 +28,34 @@ bool merges(CXDChangeRecord& record) {
     }
 }
 
-bool startsFold(CXDChangeRecord& record) {
-    if (record.appliesToSources() == CXDSyncSourceCX || !isGroupChange(record)) return false;
+// A record of the work list: itself, or its part for one source, which is made when it is needed. A record's part
+// differs from it in the mask alone, unless the record has a delayed payload.
+class Part {
+public:
+    explicit Part(CXDChangeRecordPtr record) : _record(std::move(record)), _isWhole(true) {}
+    Part(CXDChangeRecordPtr record, int32_t sources) : _record(std::move(record)), _sources(sources) {}
+
+    bool isFolded() const { return !_record; }
+    void fold() { _record = nullptr; }
+    CXDChangeRecord& content() { return *_record; } // but for the mask
+    int32_t sources() const { return _isWhole ? _record->appliesToSources() : _sources; }
+    CXDChangeRecordPtr take() {
+        CXDChangeRecordPtr taken = std::move(_record);
+        if (_isWhole) return taken;
+        taken = taken->copy();
+        taken->setAppliesToSources(_sources);
+        return taken;
+    }
+
+private:
+    CXDChangeRecordPtr _record;
+    int32_t _sources = 0;
+    bool _isWhole = false;
+};
+
+bool startsFold(Part& part) {
+    CXDChangeRecord& record = part.content();
+    if (part.sources() == CXDSyncSourceCX || !isGroupChange(record)) return false;
     switch (record.type()) {
     case CXDCompositeGroupChange:
     case CXDChangeGroupReadACL:
@@ -37,62 +66,76 @@ bool startsFold(CXDChangeRecord& record) {
     }
 }
 
-CXDChangeRecords split(const CXDChangeRecords& records) {
-    CXDChangeRecords work;
+std::vector<Part> split(const CXDChangeRecords& records) {
+    std::vector<Part> work;
     work.reserve(records.size());
     for (const CXDChangeRecordPtr& record : records) {
         if (!isGroupChange(*record)) {
-            work.push_back(record);
+            work.emplace_back(record);
             continue;
         }
-        for (CXDChangeRecordPtr& part : record->splitChangeRecord()) work.push_back(std::move(part));
+        if (record->hasDelayedPayload()) {
+            for (CXDChangeRecordPtr& part : record->splitChangeRecord()) work.emplace_back(std::move(part));
+            continue;
+        }
+        for (const int32_t source : CXDChangeRecord::kSplitOrder)
+            if (record->appliesToSources() & source) work.emplace_back(record, source);
     }
     return work;
 }
 
-CXDChangeRecordPtr compositeFor(const CXDChangeRecord& record) {
+CXDChangeRecordPtr compositeFor(Part& part) {
+    const CXDChangeRecord& record = part.content();
     auto composite = std::make_shared<CXDChangeRecord>(record.initialSource(), CXDCompositeGroupChange, record.user(),
                                                        std::nullopt, record.group());
-    composite->setAppliesToSources(record.appliesToSources());
+    composite->setAppliesToSources(part.sources());
     return composite;
 }
 
 } // namespace
 
 CXDChangeRecords flattenGroupChanges(const CXDChangeRecords& records) {
-    CXDChangeRecords work = split(records);
-    std::unordered_map<UniqueId, std::vector<size_t>> placesOfGroup; // ascending
+    std::vector<Part> work = split(records);
+    std::unordered_map<UniqueId, std::vector<uint32_t>> placesOfGroup; // ascending
     for (size_t i = 0; i < work.size(); ++i)
-        if (isGroupChange(*work[i])) placesOfGroup[*work[i]->group()].push_back(i);
+        if (isGroupChange(work[i].content()))
+            placesOfGroup[*work[i].content().group()].push_back(static_cast<uint32_t>(i));
 
     CXDChangeRecords flat; // from the back to the front
     for (size_t i = work.size(); i-- > 0;) {
-        const CXDChangeRecordPtr record = std::move(work[i]);
-        work[i] = nullptr;
-        if (!record) continue; // folded already
-        if (!startsFold(*record)) {
-            flat.push_back(record);
+        if (work[i].isFolded()) continue;
+        if (!startsFold(work[i])) {
+            flat.push_back(work[i].take());
             continue;
         }
-        const CXDChangeRecordPtr composite = compositeFor(*record);
-        composite->mergeWithGroupChangeRecord(*record);
-        std::vector<size_t>& places = placesOfGroup[*record->group()];
-        std::vector<size_t> kept;
+        const CXDChangeRecordPtr composite = compositeFor(work[i]);
+        composite->mergeWithGroupChangeRecord(work[i].content());
+        std::vector<uint32_t>& places = placesOfGroup[*composite->group()];
+        work[i].fold();
+        std::vector<uint32_t> kept;
         for (; !places.empty(); places.pop_back()) {
-            const size_t place = places.back();
-            if (!work[place]) continue;
-            if (!merges(*work[place])) {
-                kept.push_back(place);
+            Part& earlier = work[places.back()];
+            if (earlier.isFolded()) continue;
+            if (!merges(earlier.content())) {
+                kept.push_back(places.back());
                 continue;
             }
-            composite->mergeWithGroupChangeRecord(*work[place]);
-            work[place] = nullptr;
+            composite->mergeWithGroupChangeRecord(earlier.content());
+            earlier.fold();
         }
         places.assign(kept.rbegin(), kept.rend());
         flat.push_back(composite);
     }
     std::reverse(flat.begin(), flat.end());
     return flat;
+}
+
+void sortByType(CXDChangeRecords& records) {
+    std::map<uint32_t, CXDChangeRecords> byType; // the order of compare
+    for (CXDChangeRecordPtr& record : records)
+        byType[static_cast<uint32_t>(record->type())].push_back(std::move(record));
+    records.clear();
+    for (auto& [type, all] : byType) std::move(all.begin(), all.end(), std::back_inserter(records));
 }
 
 } // namespace rolvane

@@ -15,4 +15,7 @@ inline const UniqueId kPeopleGroup{"People"};
 // What merging refuses (CXDChangeRecord::canBeMerged, or a payload that cannot be read) stands for itself.
 CXDChangeRecords flattenGroupChanges(const CXDChangeRecords& records);
 
+// Sorts by CXDChangeRecord::compare; equal ones keep their order. O(C).
+void sortByType(CXDChangeRecords& records);
+
 } // namespace rolvane

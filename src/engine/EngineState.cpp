@@ -61,9 +61,10 @@ CXDChangeRecords EngineState::getPendingChanges() const {
     try {
         const Value stored = _preferences.get(kDaemonDomain, kCXDPendingChanges);
         if (!stored.isData()) return records;
-        for (KeyedArchive::Object& object : KeyedArchive::unarchive(stored.data()))
+        KeyedArchive::unarchive(stored.data(), [&](KeyedArchive::Object object) {
             if (object.className == kRecordClass)
                 records.push_back(std::make_shared<CXDChangeRecord>(DictionaryCoder(std::move(object.keys))));
+        });
     } catch (const CXException& e) {
         // What does not unarchive is no queue. A file that cannot be read just now is something else: its queue stays.
         if (e.name() == kCXPreferencesException) throw;
@@ -78,7 +79,7 @@ void EngineState::setPendingChanges(const CXDChangeRecords& records) {
         records[i]->encodeWithCoder(coder);
         return KeyedArchive::Object{kRecordClass, coder.entries()};
     };
-    _preferences.set(kDaemonDomain, kCXDPendingChanges, KeyedArchive::archive(records.size(), archived));
+    _preferences.setData(kDaemonDomain, kCXDPendingChanges, KeyedArchive::archive(records.size(), archived));
     _preferences.synchronize(kDaemonDomain);
 }
 

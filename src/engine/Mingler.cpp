@@ -5,7 +5,10 @@
 
 #include <algorithm>
 #include <array>
+#include <deque>
+#include <functional>
 #include <optional>
+#include <unordered_map>
 #include <vector>
 
 namespace rolvane {
@@ -55,93 +58,136 @@ Outcome settle(const CXDChangeRecord& record, const CXDChangeRecord& element) {
     return outcome;
 }
 
+// An open-addressed table from hashes to numbers; the caller tells which of the numbers with a hash is the one. Two
+// hundred thousand numbers take a few megabytes in one piece: most of what a large pass looks up stays in the cache.
+class Numbers {
+public:
+    static constexpr uint32_t kNone = UINT32_MAX;
+
+    template <class IsIt>
+    uint32_t find(uint32_t hash, IsIt&& isIt) const {
+        if (_slots.empty()) return kNone;
+        for (size_t i = hash & mask(); _slots[i].number != kNone; i = (i + 1) & mask())
+            if (_slots[i].hash == hash && isIt(_slots[i].number)) return _slots[i].number;
+        return kNone;
+    }
+    void add(uint32_t hash, uint32_t number) {
+        if ((_count + 1) * 2 > _slots.size()) grow();
+        put({hash, number});
+        ++_count;
+    }
+
+private:
+    struct Slot {
+        uint32_t hash = 0, number = kNone;
+    };
+    size_t mask() const { return _slots.size() - 1; }
+    void put(const Slot& slot) {
+        size_t i = slot.hash & mask();
+        while (_slots[i].number != kNone) i = (i + 1) & mask();
+        _slots[i] = slot;
+    }
+    void grow() {
+        std::vector<Slot> before(std::max<size_t>(16, _slots.size() * 2));
+        before.swap(_slots);
+        for (const Slot& slot : before)
+            if (slot.number != kNone) put(slot);
+    }
+
+    std::vector<Slot> _slots;
+    size_t _count = 0;
+};
+
+uint32_t folded(size_t hash) {
+    return static_cast<uint32_t>(hash ^ (hash >> 32));
+}
+
+constexpr uint32_t kNone = Numbers::kNone;
+
 } // namespace
 
-// The accepted records. Removing takes out whatever equals the record; the places are kept until the end.
+// The accepted records in order, numbered. Removing takes out whatever equals the record; the numbers stay.
 class Mingler::List {
 public:
+    uint32_t next() const { return static_cast<uint32_t>(_records.size()); }
+    const CXDChangeRecordPtr& operator[](uint32_t number) const { return _records[number]; }
     void append(const CXDChangeRecordPtr& record) {
-        if (_indexed) _places.emplace(record, _records.size());
+        if (_indexed) _equal.emplace(record, next());
         _records.push_back(record);
     }
     void removeEqual(const CXDChangeRecordPtr& record) {
         if (!_indexed) buildIndex();
-        const auto [first, last] = _places.equal_range(record);
-        for (auto it = first; it != last; ++it) _records[it->second].reset();
-        _places.erase(first, last);
+        _removed.resize(_records.size());
+        const auto [first, last] = _equal.equal_range(record);
+        for (auto it = first; it != last; ++it) _removed[it->second] = true;
+        _equal.erase(first, last);
     }
     CXDChangeRecords take() {
-        _places.clear();
+        _equal.clear();
         _indexed = false;
-        std::erase(_records, nullptr);
+        if (!_removed.empty()) {
+            _removed.resize(_records.size());
+            size_t i = 0;
+            std::erase_if(_records, [&](const CXDChangeRecordPtr&) { return _removed[i++]; });
+        }
         return std::move(_records);
     }
 
 private:
     void buildIndex() {
-        for (size_t i = 0; i < _records.size(); ++i)
-            if (_records[i]) _places.emplace(_records[i], i);
+        for (uint32_t i = 0; i < _records.size(); ++i) _equal.emplace(_records[i], i);
         _indexed = true;
     }
     CXDChangeRecords _records;
-    std::unordered_multimap<CXDChangeRecordPtr, size_t, RecordHash, RecordEqual> _places;
+    std::vector<bool> _removed; // empty while nothing is
+    std::unordered_multimap<CXDChangeRecordPtr, uint32_t, RecordHash, RecordEqual> _equal;
     bool _indexed = false; // contradictions are rare: most passes never need the index
 };
 
-class Mingler::Bucket {
+// The elements of all buckets. Those of one bucket are chained from the latest to the earliest.
+class Mingler::Elements {
 public:
-    // mingleChangeRecord:from:withBucket:
-    bool mingle(const CXDChangeRecordPtr& record, List& mingled, size_t indexFrom) {
-        if (!_indexed && _elements.size() >= indexFrom) buildIndex();
-        const bool accepted = _indexed ? passesIndex(record, mingled) : passesWalk(record, mingled);
-        if (accepted) append(record);
-        return accepted;
+    struct Element {
+        uint32_t record; // its number in the list; kNone after the removal
+        uint32_t previous;
+    };
+    Element& operator[](uint32_t element) { return _elements[element]; }
+    uint32_t add(uint32_t record, uint32_t previous) {
+        _elements.push_back({record, previous});
+        return static_cast<uint32_t>(_elements.size() - 1);
     }
 
 private:
-    using Place = size_t;
-    // Ascending places; what has been removed since is dropped when it comes to the top.
-    struct Candidates {
-        std::vector<Place> owners, others;
-    };
-    using ByIdentifier = std::unordered_map<UniqueId, std::array<Candidates, 2>>; // [is a removal]
+    std::vector<Element> _elements;
+};
 
-    bool passesWalk(const CXDChangeRecordPtr& record, List& mingled) {
-        for (Place i = _elements.size(); i-- > 0;) {
-            const CXDChangeRecordPtr element = _elements[i];
-            if (element->isEqual(*record)) return false;
-            const Outcome outcome = settle(*record, *element);
-            if (outcome == Outcome::recordLoses) return false;
-            if (outcome == Outcome::elementLoses) {
-                _elements.erase(_elements.begin() + static_cast<std::ptrdiff_t>(i));
-                mingled.removeEqual(element);
-            }
-        }
-        return true;
+// What a long bucket is searched by.
+class Mingler::Index {
+public:
+    Index(const List& list, Elements& elements) : _list(list), _elements(elements) {}
+
+    void add(uint32_t element) {
+        const CXDChangeRecord& record = recordOf(element);
+        _equal.add(hashOf(record), element);
+        _all.push_back(element);
+        ++(isRemoval(record) ? _removals : _others);
+        if (_byIdentifierBuilt) addByIdentifier(element);
+    }
+    void remove(uint32_t element) { _elements[element].record = kNone; }
+
+    uint32_t findEqual(const CXDChangeRecord& record) const {
+        return _equal.find(hashOf(record), [&](uint32_t element) {
+            return _elements[element].record != kNone && recordOf(element).isEqual(record);
+        });
     }
 
-    // The same over the index: only elements behind the equal one (if there is one) are ever reached.
-    bool passesIndex(const CXDChangeRecordPtr& record, List& mingled) {
-        const auto equal = _equal.find(record);
-        const std::optional<Place> stop = equal == _equal.end() ? std::nullopt : std::optional(equal->second);
-        for (const Place place : candidates(*record, stop)) {
-            const CXDChangeRecordPtr element = _elements[place];
-            const Outcome outcome = settle(*record, *element);
-            if (outcome == Outcome::recordLoses) return false;
-            if (outcome == Outcome::elementLoses) {
-                _equal.erase(element);
-                _elements[place].reset();
-                mingled.removeEqual(element);
-            }
-        }
-        return !stop;
-    }
-
-    // What the walk would reach and contradict, latest first. Where only the outcome counts and nobody reads the log,
-    // a subscriber's record needs no more than the latest contradiction of the owner.
-    std::vector<Place> candidates(const CXDChangeRecord& record, std::optional<Place> stop) {
+    // The elements behind `stop` that the walk would reach and that contradict, latest first. Where only the outcome
+    // counts and nobody reads the log, a subscriber's record needs no more than the latest contradiction of the owner.
+    std::vector<uint32_t> candidates(const CXDChangeRecord& record, uint32_t stop) {
+        std::vector<uint32_t> found;
+        if ((isRemoval(record) ? _others : _removals) == 0) return found; // nothing here can contradict it
+        if (!_byIdentifierBuilt) buildByIdentifier();
         const bool all = record.changeMadeByDataOwner() || debugLevel() != 0;
-        std::vector<Place> found;
         const auto gather = [&](ByIdentifier& index, const std::optional<UniqueId>& identifier) {
             if (!identifier) return;
             const auto it = index.find(*identifier);
@@ -157,61 +203,155 @@ private:
         return found;
     }
 
-    void collect(std::vector<Place>& places, std::optional<Place> stop, bool all, std::vector<Place>& found) {
-        while (!places.empty() && !_elements[places.back()]) places.pop_back();
-        for (auto it = places.rbegin(); it != places.rend() && (!stop || *it > *stop); ++it) {
-            if (!_elements[*it]) continue;
+private:
+    // Ascending; what has been removed since is dropped when it comes to the top.
+    struct Candidates {
+        std::vector<uint32_t> owners, others;
+    };
+    using ByIdentifier = std::unordered_map<UniqueId, std::array<Candidates, 2>>; // [is a removal]
+
+    const CXDChangeRecord& recordOf(uint32_t element) const { return *_list[_elements[element].record]; }
+    static uint32_t hashOf(const CXDChangeRecord& record) { return folded(RecordHash()(record)); }
+
+    void collect(std::vector<uint32_t>& elements, uint32_t stop, bool all, std::vector<uint32_t>& found) {
+        while (!elements.empty() && _elements[elements.back()].record == kNone) elements.pop_back();
+        for (auto it = elements.rbegin(); it != elements.rend() && (stop == kNone || *it > stop); ++it) {
+            if (_elements[*it].record == kNone) continue;
             found.push_back(*it);
             if (!all) return;
         }
     }
-
-    void append(const CXDChangeRecordPtr& record) {
-        if (_indexed) index(record, _elements.size());
-        _elements.push_back(record);
+    void buildByIdentifier() {
+        for (const uint32_t element : _all)
+            if (_elements[element].record != kNone) addByIdentifier(element);
+        _byIdentifierBuilt = true;
     }
-
-    void buildIndex() {
-        for (Place i = 0; i < _elements.size(); ++i) index(_elements[i], i);
-        _indexed = true;
-    }
-
-    void index(const CXDChangeRecordPtr& record, Place place) {
-        _equal.emplace(record, place);
-        const auto add = [&](ByIdentifier& byIdentifier, const std::optional<UniqueId>& identifier) {
+    void addByIdentifier(uint32_t element) {
+        const CXDChangeRecord& record = recordOf(element);
+        const auto add = [&](ByIdentifier& index, const std::optional<UniqueId>& identifier) {
             if (!identifier) return;
-            Candidates& same = byIdentifier[*identifier][isRemoval(*record) ? 1 : 0];
-            (record->changeMadeByDataOwner() ? same.owners : same.others).push_back(place);
+            Candidates& same = index[*identifier][isRemoval(record) ? 1 : 0];
+            (record.changeMadeByDataOwner() ? same.owners : same.others).push_back(element);
         };
-        add(_byPerson, record->person());
-        if (record->type() != CXDUpdateDistributionList) add(_byGroup, record->group());
+        add(_byPerson, record.person());
+        if (record.type() != CXDUpdateDistributionList) add(_byGroup, record.group());
     }
 
-    CXDChangeRecords _elements; // with an index: null where an element was removed
-    bool _indexed = false;
-    std::unordered_map<CXDChangeRecordPtr, Place, RecordHash, RecordEqual> _equal;
+    const List& _list;
+    Elements& _elements;
+    Numbers _equal;
+    std::vector<uint32_t> _all; // ascending
+    size_t _removals = 0, _others = 0;
+    bool _byIdentifierBuilt = false; // only needed where removals meet what is none
     ByIdentifier _byPerson, _byGroup;
 };
 
-Mingler::Mingler(size_t indexFrom) : _indexFrom(indexFrom), _mingled(std::make_unique<List>()) {}
+struct Mingler::Bucket {
+    UniqueId identifier;
+    uint32_t last = kNone; // element
+    uint32_t count = 0;    // removed ones included
+    std::unique_ptr<Index> index;
+};
+
+class Mingler::Buckets {
+public:
+    explicit Buckets(size_t indexFrom) : _indexFrom(indexFrom) {}
+
+    // mingleChangeRecord:from:withBucket: of the identifier's bucket.
+    bool mingle(const UniqueId& identifier, const CXDChangeRecordPtr& record) {
+        Bucket& bucket = bucketOf(identifier);
+        if (!bucket.index && bucket.count >= _indexFrom) buildIndex(bucket);
+        const bool accepted = bucket.index ? passesIndex(*bucket.index, record) : passesWalk(bucket, record);
+        if (accepted) _justAccepted.push_back(&bucket);
+        return accepted;
+    }
+    // To be called when the record has passed its buckets.
+    bool appendIfAccepted(const CXDChangeRecordPtr& record) {
+        if (_justAccepted.empty()) return false;
+        const uint32_t number = list.next();
+        list.append(record);
+        for (Bucket* bucket : _justAccepted) {
+            bucket->last = _elements.add(number, bucket->last);
+            ++bucket->count;
+            if (bucket->index) bucket->index->add(bucket->last);
+        }
+        _justAccepted.clear();
+        return true;
+    }
+
+    List list;
+
+private:
+    Bucket& bucketOf(const UniqueId& identifier) {
+        const uint32_t hash = identifier.text().hash();
+        const uint32_t known =
+            _byIdentifier.find(hash, [&](uint32_t number) { return _buckets[number].identifier == identifier; });
+        if (known != kNone) return _buckets[known];
+        _byIdentifier.add(hash, static_cast<uint32_t>(_buckets.size()));
+        _buckets.push_back({identifier, kNone, 0, nullptr});
+        return _buckets.back();
+    }
+
+    bool passesWalk(Bucket& bucket, const CXDChangeRecordPtr& record) {
+        uint32_t* link = &bucket.last;
+        while (*link != kNone) {
+            const CXDChangeRecordPtr& element = list[_elements[*link].record];
+            if (element->isEqual(*record)) return false;
+            const Outcome outcome = settle(*record, *element);
+            if (outcome == Outcome::recordLoses) return false;
+            if (outcome == Outcome::elementLoses) {
+                list.removeEqual(element);
+                *link = _elements[*link].previous;
+                --bucket.count;
+            } else {
+                link = &_elements[*link].previous;
+            }
+        }
+        return true;
+    }
+
+    // The same over the index: only elements behind the equal one (if there is one) are ever reached.
+    bool passesIndex(Index& index, const CXDChangeRecordPtr& record) {
+        const uint32_t stop = index.findEqual(*record);
+        for (const uint32_t candidate : index.candidates(*record, stop)) {
+            const CXDChangeRecordPtr& element = list[_elements[candidate].record];
+            const Outcome outcome = settle(*record, *element);
+            if (outcome == Outcome::recordLoses) return false;
+            if (outcome == Outcome::elementLoses) {
+                list.removeEqual(element);
+                index.remove(candidate);
+            }
+        }
+        return stop == kNone;
+    }
+
+    void buildIndex(Bucket& bucket) {
+        bucket.index = std::make_unique<Index>(list, _elements);
+        std::vector<uint32_t> elements;
+        for (uint32_t i = bucket.last; i != kNone; i = _elements[i].previous) elements.push_back(i);
+        for (auto it = elements.rbegin(); it != elements.rend(); ++it) bucket.index->add(*it);
+    }
+
+    size_t _indexFrom;
+    Elements _elements;
+    Numbers _byIdentifier;
+    std::deque<Bucket> _buckets; // stay where they are
+    std::vector<Bucket*> _justAccepted;
+};
+
+Mingler::Mingler(size_t indexFrom) : _buckets(std::make_unique<Buckets>(indexFrom)) {}
 Mingler::~Mingler() = default;
 
-bool Mingler::mingleIntoBucket(const UniqueId& identifier, const CXDChangeRecordPtr& record) {
-    std::unique_ptr<Bucket>& bucket = _buckets[identifier];
-    if (!bucket) bucket = std::make_unique<Bucket>();
-    return bucket->mingle(record, *_mingled, _indexFrom);
-}
-
 bool Mingler::mingle(const CXDChangeRecordPtr& record) {
-    bool accepted = false;
-    if (record->person()) accepted = mingleIntoBucket(*record->person(), record);
-    if (record->group()) accepted = mingleIntoBucket(*record->group(), record) || accepted;
-    if (accepted) _mingled->append(record);
-    return accepted;
+    const bool accepted = record->person() && _buckets->mingle(*record->person(), record);
+    // In a bucket that has just accepted it, it would meet itself.
+    if (record->group() && !(accepted && record->group() == record->person()))
+        _buckets->mingle(*record->group(), record);
+    return _buckets->appendIfAccepted(record);
 }
 
 CXDChangeRecords Mingler::takeMingled() {
-    return _mingled->take();
+    return _buckets->list.take();
 }
 
 } // namespace rolvane

@@ -4,7 +4,6 @@
 
 #include <cstddef>
 #include <memory>
-#include <unordered_map>
 
 namespace rolvane {
 
@@ -28,13 +27,12 @@ public:
     CXDChangeRecords takeMingled();
 
 private:
-    class Bucket;
     class List;
-    bool mingleIntoBucket(const UniqueId& identifier, const CXDChangeRecordPtr& record);
-
-    size_t _indexFrom;
-    std::unique_ptr<List> _mingled;
-    std::unordered_map<UniqueId, std::unique_ptr<Bucket>> _buckets;
+    class Elements;
+    class Index;
+    struct Bucket;
+    class Buckets;
+    std::unique_ptr<Buckets> _buckets;
 };
 
 } // namespace rolvane

@@ -27,6 +27,10 @@ public:
         default: leaf(v);
         }
     }
+    void varint(uint64_t n) {
+        for (; n >= 0x80; n >>= 7) _out.push_back(static_cast<uint8_t>(n) | 0x80);
+        _out.push_back(static_cast<uint8_t>(n));
+    }
 
 private:
     void leaf(const Value& v) {
@@ -65,10 +69,6 @@ private:
             refuse(fmt::format("its containers are nested deeper than {}", BinaryValue::kMaxDepth));
     }
     void tag(ValueType t) { _out.push_back(static_cast<uint8_t>(t)); }
-    void varint(uint64_t n) {
-        for (; n >= 0x80; n >>= 7) _out.push_back(static_cast<uint8_t>(n) | 0x80);
-        _out.push_back(static_cast<uint8_t>(n));
-    }
     void real(double d) {
         auto bits = std::bit_cast<uint64_t>(d);
         for (int i = 0; i < 8; ++i, bits >>= 8) _out.push_back(static_cast<uint8_t>(bits));
@@ -95,8 +95,7 @@ public:
         if (_at != _end) refuse(fmt::format("{} bytes follow its end", left()));
         return v;
     }
-
-private:
+    const uint8_t* at() const { return _at; }
     Value value() {
         const uint8_t tag = byte();
         if (tag == kFalse || tag == kTrue) return tag == kTrue;
@@ -113,6 +112,19 @@ private:
         }
     }
 
+    uint64_t varint() {
+        uint64_t n = 0;
+        for (int shift = 0;; shift += 7) {
+            const uint8_t b = byte();
+            if (shift == 63 && b > 1) refuse("a number in it has more than 64 bits");
+            n |= static_cast<uint64_t>(b & 0x7f) << shift;
+            if (b & 0x80) continue;
+            if (b == 0 && shift > 0) refuse("a number in it is not in its shortest form");
+            return n;
+        }
+    }
+
+private:
     Array array() {
         enter();
         const size_t n = count(1);
@@ -126,11 +138,12 @@ private:
     Dictionary dictionary() {
         enter();
         Dictionary d;
-        std::string last;
+        std::string_view last;
         for (size_t n = count(2), i = 0; i < n; ++i) {
-            std::string key = string();
-            if (i > 0 && key <= last) refuse("the keys of a dictionary are not in ascending order");
-            last = key;
+            const std::string_view text = stringView();
+            if (i > 0 && text <= last) refuse("the keys of a dictionary are not in ascending order");
+            last = text;
+            std::string key(text);
             Value v = value();
             if (v.isAbsent()) refuse("a dictionary holds an absent value");
             d.setIfNew(std::move(key), std::move(v));
@@ -148,17 +161,6 @@ private:
         if (_at == _end) refuse("it ends too early");
         return *_at++;
     }
-    uint64_t varint() {
-        uint64_t n = 0;
-        for (int shift = 0;; shift += 7) {
-            const uint8_t b = byte();
-            if (shift == 63 && b > 1) refuse("a number in it has more than 64 bits");
-            n |= static_cast<uint64_t>(b & 0x7f) << shift;
-            if (b & 0x80) continue;
-            if (b == 0 && shift > 0) refuse("a number in it is not in its shortest form");
-            return n;
-        }
-    }
     // A count of elements of at least `each` bytes: never more than the bytes that are left can hold.
     size_t count(size_t each) {
         const uint64_t n = varint();
@@ -171,9 +173,10 @@ private:
         for (int i = 0; i < 8; ++i) bits |= static_cast<uint64_t>(*_at++) << (8 * i);
         return std::bit_cast<double>(bits);
     }
-    std::string string() {
+    std::string string() { return std::string(stringView()); }
+    std::string_view stringView() {
         const size_t n = count(1);
-        std::string s(reinterpret_cast<const char*>(_at), n);
+        const std::string_view s(reinterpret_cast<const char*>(_at), n);
         _at += n;
         return s;
     }
@@ -204,6 +207,39 @@ void BinaryValue::encodeTo(const Value& value, Bytes& out) {
 
 Value BinaryValue::decode(const uint8_t* data, size_t size) {
     return Decoder(data, size).whole();
+}
+
+Bytes BinaryValue::encodeData(Bytes data) {
+    Bytes front{static_cast<uint8_t>(ValueType::data)};
+    Encoder(front).varint(data.size());
+    data.insert(data.begin(), front.begin(), front.end());
+    return data;
+}
+
+Value BinaryValue::decode(Bytes&& bytes) {
+    if (bytes.empty() || bytes.front() != static_cast<uint8_t>(ValueType::data))
+        return decode(bytes.data(), bytes.size());
+    const uint8_t* at = bytes.data() + 1;
+    size_t left = bytes.size() - 1;
+    if (decodeCount(at, left) != left) return decode(bytes.data(), bytes.size()); // which says what is wrong
+    bytes.erase(bytes.begin(), bytes.end() - static_cast<std::ptrdiff_t>(left));
+    return Value(std::move(bytes));
+}
+
+Value BinaryValue::decodeFront(const uint8_t*& data, size_t& size) {
+    Decoder decoder(data, size);
+    Value v = decoder.value();
+    size -= static_cast<size_t>(decoder.at() - data);
+    data = decoder.at();
+    return v;
+}
+
+uint64_t BinaryValue::decodeCount(const uint8_t*& data, size_t& size) {
+    Decoder decoder(data, size);
+    const uint64_t n = decoder.varint();
+    size -= static_cast<size_t>(decoder.at() - data);
+    data = decoder.at();
+    return n;
 }
 
 } // namespace rolvane

@@ -20,6 +20,12 @@ public:
     static void encodeTo(const Value& value, Bytes& out); // appends; what was appended is undefined after a throw
     static Value decode(const uint8_t* data, size_t size);
     static Value decode(const Bytes& bytes) { return decode(bytes.data(), bytes.size()); }
+    // The form of a data value, and its value, in the memory that the bytes have: for data that is large.
+    static Bytes encodeData(Bytes data);
+    static Value decode(Bytes&& bytes);
+    // One value at the front of the bytes, which then begin behind it.
+    static Value decodeFront(const uint8_t*& data, size_t& size);
+    static uint64_t decodeCount(const uint8_t*& data, size_t& size); // a varint, likewise
 };
 
 } // namespace rolvane

@@ -9,6 +9,7 @@ namespace rolvane {
 namespace {
 
 constexpr std::string_view kMagic = "RKA1";
+constexpr size_t kProbe = 256; // so many objects tell how long the others are
 
 [[noreturn]] void refuse(const std::string& reason) {
     throw CXException(kCXArchiveException, "the keyed archive cannot be read: " + reason);
@@ -19,14 +20,13 @@ void appendVarint(uint64_t n, Bytes& out) {
     out.push_back(static_cast<uint8_t>(n));
 }
 
-// What stands before the elements in the BinaryValue form of {key: array of `count` elements}.
-void beginDictionaryOfOneArray(std::string_view key, size_t count, Bytes& out) {
+// What stands before the count of the elements in the BinaryValue form of {key: array}.
+void beginDictionaryOfOneArray(std::string_view key, Bytes& out) {
     out.push_back(static_cast<uint8_t>(ValueType::dictionary));
     appendVarint(1, out);
     appendVarint(key.size(), out);
     out.insert(out.end(), key.begin(), key.end());
     out.push_back(static_cast<uint8_t>(ValueType::array));
-    appendVarint(count, out);
 }
 
 KeyedArchive::Object objectFrom(const Value& v) {
@@ -62,8 +62,10 @@ Bytes KeyedArchive::archive(const std::vector<Object>& objects) {
 
 Bytes KeyedArchive::archive(size_t count, const std::function<Object(size_t)>& objectAt) {
     Bytes out(kMagic.begin(), kMagic.end());
-    beginDictionaryOfOneArray("objects", count, out);
+    beginDictionaryOfOneArray("objects", out);
+    appendVarint(count, out);
     for (size_t i = 0; i < count; ++i) {
+        if (i == kProbe) out.reserve(out.size() / kProbe * (count + count / 16) + kProbe); // else doubled several times
         const Object object = objectAt(i);
         BinaryValue::encodeTo(Dictionary{{"class", object.className}, {"keys", object.keys}}, out);
     }
@@ -71,15 +73,24 @@ Bytes KeyedArchive::archive(size_t count, const std::function<Object(size_t)>& o
 }
 
 std::vector<KeyedArchive::Object> KeyedArchive::unarchive(const Bytes& bytes) {
+    std::vector<Object> objects;
+    unarchive(bytes, [&](Object object) { objects.push_back(std::move(object)); });
+    return objects;
+}
+
+void KeyedArchive::unarchive(const Bytes& bytes, const std::function<void(Object)>& take) {
     if (bytes.size() < kMagic.size() || !std::equal(kMagic.begin(), kMagic.end(), bytes.begin()))
         refuse("it does not begin with \"RKA1\"");
-    const Value root = BinaryValue::decode(bytes.data() + kMagic.size(), bytes.size() - kMagic.size());
-    const Array* entries = root.dictionary()["objects"].arrayIf();
-    if (!entries) refuse("it has no list of objects");
-    std::vector<Object> objects;
-    objects.reserve(entries->count());
-    for (const Value& v : *entries) objects.push_back(objectFrom(v));
-    return objects;
+    Bytes before;
+    beginDictionaryOfOneArray("objects", before);
+    const uint8_t* at = bytes.data() + kMagic.size();
+    size_t left = bytes.size() - kMagic.size();
+    if (left < before.size() || !std::equal(before.begin(), before.end(), at)) refuse("it has no list of objects");
+    at += before.size();
+    left -= before.size();
+    for (uint64_t count = BinaryValue::decodeCount(at, left); count > 0; --count)
+        take(objectFrom(BinaryValue::decodeFront(at, left)));
+    if (left != 0) refuse(std::to_string(left) + " bytes follow its end");
 }
 
 } // namespace rolvane

@@ -50,6 +50,9 @@ public:
     // The same bytes from objects that are made one after the other, so that they never stand in memory together.
     static Bytes archive(size_t count, const std::function<Object(size_t)>& objectAt);
     static std::vector<Object> unarchive(const Bytes& bytes); // throws kCXArchiveException
+    // Hands over one object after the other, so that they need not stand in memory together. Throws the same, and then
+    // some objects may have been handed over.
+    static void unarchive(const Bytes& bytes, const std::function<void(Object)>& take);
 };
 
 } // namespace rolvane

@@ -30,9 +30,9 @@ struct Preferences::Impl {
         changes->second.insert_or_assign(std::string(key), std::move(bytes));
     }
 
-    Value decode(std::string_view domain, std::string_view key, const Bytes& bytes) const {
+    Value decode(std::string_view domain, std::string_view key, Bytes bytes) const {
         try {
-            return BinaryValue::decode(bytes);
+            return BinaryValue::decode(std::move(bytes));
         } catch (const CXException& e) {
             throw CXException(
                 kCXArchiveException,
@@ -74,12 +74,16 @@ Value Preferences::get(std::string_view domain, std::string_view key) const {
         else
             bytes = _impl->file.read(domain, key);
     }
-    return bytes ? _impl->decode(domain, key, *bytes) : Value();
+    return bytes ? _impl->decode(domain, key, std::move(*bytes)) : Value();
 }
 
 void Preferences::set(std::string_view domain, std::string_view key, Value value) {
     if (value.isAbsent()) return remove(domain, key);
     _impl->stage(domain, key, BinaryValue::encode(value));
+}
+
+void Preferences::setData(std::string_view domain, std::string_view key, Bytes data) {
+    _impl->stage(domain, key, BinaryValue::encodeData(std::move(data)));
 }
 
 void Preferences::remove(std::string_view domain, std::string_view key) {

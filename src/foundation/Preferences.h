@@ -25,8 +25,9 @@ public:
     Preferences(const Preferences&) = delete;
     Preferences& operator=(const Preferences&) = delete;
 
-    Value get(std::string_view domain, std::string_view key) const;       // absent when there is none
-    void set(std::string_view domain, std::string_view key, Value value); // an absent value removes
+    Value get(std::string_view domain, std::string_view key) const;          // absent when there is none
+    void set(std::string_view domain, std::string_view key, Value value);    // an absent value removes
+    void setData(std::string_view domain, std::string_view key, Bytes data); // as a data value, which is not copied
     void remove(std::string_view domain, std::string_view key);
     void synchronize(std::string_view domain);
     std::vector<std::string> keys(std::string_view domain) const; // in byte order, unwritten changes included

@@ -234,12 +234,23 @@ void PreferencesFile::bindText(sqlite3_stmt* statement, int index, std::string_v
 
 std::optional<Bytes> PreferencesFile::read(std::string_view domain, std::string_view key) {
     if (!openExisting()) return {};
-    auto statement = prepare("SELECT value FROM preferences WHERE domain = ?1 AND key = ?2");
+    auto statement = prepare("SELECT rowid, length(value) FROM preferences WHERE domain = ?1 AND key = ?2");
     bindText(statement.get(), 1, domain);
     bindText(statement.get(), 2, key);
     if (!step(statement.get())) return {};
-    auto* bytes = static_cast<const uint8_t*>(sqlite3_column_blob(statement.get(), 0));
-    return Bytes(bytes, bytes + sqlite3_column_bytes(statement.get(), 0));
+    // Straight into place: as a column, a large value would stand in memory twice. The open statement keeps the view.
+    Bytes bytes(static_cast<size_t>(sqlite3_column_int64(statement.get(), 1)));
+    sqlite3_blob* blob = nullptr;
+    int code =
+        sqlite3_blob_open(_db, "main", "preferences", "value", sqlite3_column_int64(statement.get(), 0), 0, &blob);
+    if (code == SQLITE_OK && sqlite3_blob_bytes(blob) != static_cast<int>(bytes.size())) code = SQLITE_CORRUPT;
+    if (code == SQLITE_OK) code = sqlite3_blob_read(blob, bytes.data(), static_cast<int>(bytes.size()), 0);
+    if (code != SQLITE_OK) {
+        sqlite3_blob_close(blob);
+        fail(code);
+    }
+    sqlite3_blob_close(blob);
+    return bytes;
 }
 
 std::vector<std::string> PreferencesFile::strings(const char* sql, std::optional<std::string_view> argument) {

@@ -1,5 +1,7 @@
 #pragma once
 
+#include "foundation/SharedText.h"
+
 #include <compare>
 #include <functional>
 #include <string>
@@ -9,25 +11,28 @@
 namespace rolvane {
 
 // A string with a meaning of its own: two different ones cannot be swapped, compared or assigned by accident.
+// Immutable; copies share the text, also with the Value that is made of one.
 template <class Tag>
 class StrongString {
 public:
     StrongString() = default;
     explicit StrongString(std::string s) : _s(std::move(s)) {}
-    explicit StrongString(std::string_view s) : _s(s) {}
-    explicit StrongString(const char* s) : _s(s) {}
+    explicit StrongString(std::string_view s) : _s(std::string(s)) {}
+    explicit StrongString(const char* s) : _s(std::string(s)) {}
+    explicit StrongString(SharedText s) : _s(std::move(s)) {}
 
-    const std::string& str() const { return _s; }
-    const char* c_str() const { return _s.c_str(); }
+    const std::string& str() const { return _s.str(); }
+    const SharedText& text() const { return _s; }
+    const char* c_str() const { return str().c_str(); }
     bool empty() const { return _s.empty(); }
-    bool endsWith(std::string_view suffix) const { return std::string_view(_s).ends_with(suffix); }
+    bool endsWith(std::string_view suffix) const { return std::string_view(str()).ends_with(suffix); }
 
-    friend auto operator<=>(const StrongString&, const StrongString&) = default;
+    friend std::strong_ordering operator<=>(const StrongString&, const StrongString&) = default;
     friend bool operator==(const StrongString&, const StrongString&) = default;
-    friend const std::string& description(const StrongString& s) { return s._s; }
+    friend const std::string& description(const StrongString& s) { return s.str(); }
 
 private:
-    std::string _s;
+    SharedText _s;
 };
 
 // Whose data something is: an account name, or the owner marker "<self>".
@@ -47,5 +52,5 @@ inline const UserName kSelf{"<self>"};
 
 template <class Tag>
 struct std::hash<rolvane::StrongString<Tag>> {
-    size_t operator()(const rolvane::StrongString<Tag>& s) const noexcept { return std::hash<std::string>{}(s.str()); }
+    size_t operator()(const rolvane::StrongString<Tag>& s) const noexcept { return s.text().hash(); }
 };

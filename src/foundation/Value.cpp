@@ -2,61 +2,147 @@
 
 #include <algorithm>
 #include <atomic>
+#include <bit>
 #include <charconv>
 #include <cmath>
 #include <fmt/format.h>
-#include <unordered_map>
+#include <memory>
+#include <mutex>
 
 namespace rolvane {
 
 namespace {
 
 const Value kAbsent;
-constexpr size_t kIndexFrom = 24; // below this a linear search is as fast as the index
-
-struct StringHash {
-    using is_transparent = void;
-    size_t operator()(std::string_view s) const { return std::hash<std::string_view>{}(s); }
-};
+constexpr size_t kIndexFrom = 24;               // below this a linear search is as fast as the index
+constexpr size_t kMostIndexed = UINT32_MAX - 2; // places have 32 bits
 
 } // namespace
 
-// `index` counts the string elements: built on first need, dropped after a write that it cannot follow. Readers on
+// An open-addressed table from a string's hash to the places of the strings that have it. It holds no text: whoever
+// asks compares what stands at the place.
+class Places {
+public:
+    static constexpr uint32_t kEmpty = UINT32_MAX, kGone = UINT32_MAX - 1;
+
+    explicit Places(size_t expected) { resize(expected); }
+
+    void add(uint32_t hash, uint32_t place) {
+        if ((_used + 1) * 2 > _slots.size()) grow();
+        put(hash, place);
+        ++_used;
+    }
+    // Calls with each place of the hash until the call says true; `erase` frees the slots for which it says so.
+    template <class Call>
+    bool find(uint32_t hash, Call&& call) const {
+        for (size_t i = hash & mask(); _slots[i].place != kEmpty; i = (i + 1) & mask())
+            if (_slots[i].hash == hash && _slots[i].place != kGone && call(_slots[i].place)) return true;
+        return false;
+    }
+    template <class Call>
+    void eraseIf(uint32_t hash, Call&& call) {
+        for (size_t i = hash & mask(); _slots[i].place != kEmpty; i = (i + 1) & mask())
+            if (_slots[i].hash == hash && _slots[i].place != kGone && call(_slots[i].place)) _slots[i].place = kGone;
+    }
+
+private:
+    struct Slot {
+        uint32_t hash = 0, place = kEmpty;
+    };
+    size_t mask() const { return _slots.size() - 1; }
+    void resize(size_t expected) { _slots.assign(std::bit_ceil(std::max<size_t>(expected * 2, 16)), Slot()); }
+    void put(uint32_t hash, uint32_t place) {
+        size_t i = hash & mask();
+        while (_slots[i].place != kEmpty) i = (i + 1) & mask();
+        _slots[i] = {hash, place};
+    }
+    void grow() {
+        std::vector<Slot> before = std::move(_slots);
+        const auto isLive = [](const Slot& s) { return s.place < kGone; };
+        _used = static_cast<size_t>(std::count_if(before.begin(), before.end(), isLive));
+        resize(_used * 2);
+        for (const Slot& s : before)
+            if (isLive(s)) put(s.hash, s.place);
+    }
+
+    std::vector<Slot> _slots; // a power of two, at most half of it used
+    size_t _used = 0;         // gone ones included
+};
+
+// `index` knows the places of the string elements: built on first need, dropped when the elements move. Readers on
 // several threads may need it at once: each builds its own and the first one to finish is kept.
-struct Array::Storage {
-    using Index = std::unordered_map<std::string, size_t, StringHash, std::equal_to<>>;
+//
+// `gaps` are the places that removeAll has emptied; `gapCount` is their number. The first look at the order closes
+// them. That is a write within a reading operation: while there are gaps, readers take turns.
+struct Array::Storage : SharedObject {
     std::vector<Value> items;
-    mutable std::atomic<Index*> index{nullptr};
+    std::vector<uint32_t> gaps;
+    std::atomic<size_t> gapCount{0};
+    std::atomic<Places*> index{nullptr};
 
-    Storage() = default;
-    Storage(const Storage&) = delete;
-    Storage& operator=(const Storage&) = delete;
-    ~Storage() { delete index.load(); }
+    ~Storage() override { delete index.load(); }
 
-    const Index& counted() const {
-        if (const Index* built = index.load(std::memory_order_acquire)) return *built;
-        auto fresh = std::make_unique<Index>(items.size());
-        for (const Value& v : items)
-            if (const std::string* s = v.stringIf()) ++(*fresh)[*s];
-        Index* none = nullptr;
+    // What an operation that reads and leaves the gaps holds meanwhile.
+    std::unique_lock<std::mutex> turn() const {
+        return gapCount.load(std::memory_order_acquire) == 0 ? std::unique_lock<std::mutex>()
+                                                             : std::unique_lock(turns());
+    }
+    static std::mutex& turns() {
+        static std::mutex one; // of all arrays: gaps are rare
+        return one;
+    }
+    size_t count() const { return items.size() - gapCount.load(std::memory_order_relaxed); }
+    bool isIndexed() const { return count() >= kIndexFrom && items.size() < kMostIndexed; }
+
+    const Places& indexed() {
+        if (const Places* built = index.load(std::memory_order_acquire)) return *built;
+        auto fresh = std::make_unique<Places>(items.size());
+        for (size_t i = 0; i < items.size(); ++i)
+            if (const SharedText* s = items[i].textIf()) fresh->add(s->hash(), static_cast<uint32_t>(i));
+        Places* none = nullptr;
         if (index.compare_exchange_strong(none, fresh.get(), std::memory_order_acq_rel)) return *fresh.release();
         return *none;
     }
-    void added(const Value& v) {
-        Index* built = index.load();
-        if (!built) return;
-        if (const std::string* s = v.stringIf()) ++(*built)[*s];
-    }
-    void removed(const Value& v) {
-        Index* built = index.load();
-        const std::string* s = v.stringIf();
-        if (!built || !s) return;
-        if (auto it = built->find(*s); it != built->end() && --it->second == 0) built->erase(it);
+    void appended() {
+        Places* built = index.load();
+        const SharedText* s = items.back().textIf();
+        if (built && s) built->add(s->hash(), static_cast<uint32_t>(items.size() - 1));
     }
     void dropIndex() { delete index.exchange(nullptr); }
+
+    void takeOut(const SharedText& text) {
+        indexed();
+        index.load()->eraseIf(text.hash(), [&](uint32_t place) {
+            if (const SharedText* held = items[place].textIf(); !held || *held != text) return false;
+            items[place] = Value();
+            gaps.push_back(place);
+            return true;
+        });
+        gapCount.store(gaps.size(), std::memory_order_release);
+    }
+    void closeGaps() {
+        const std::lock_guard guard(turns());
+        if (gapCount.load(std::memory_order_relaxed) == 0) return;
+        std::sort(gaps.begin(), gaps.end());
+        size_t to = gaps.front(), gap = 0;
+        for (size_t from = to; from < items.size(); ++from) {
+            if (gap < gaps.size() && gaps[gap] == from)
+                ++gap;
+            else
+                items[to++] = std::move(items[from]);
+        }
+        items.resize(to);
+        gaps.clear();
+        dropIndex();
+        gapCount.store(0, std::memory_order_release);
+    }
 };
 
-Array::Array() : _p(std::make_shared<Storage>()) {}
+struct Dictionary::Storage : SharedObject {
+    Map map;
+};
+
+Array::Array() : _p(new Storage) {}
 Array::Array(std::initializer_list<Value> values) : Array() {
     _p->items.assign(values);
 }
@@ -64,82 +150,94 @@ Array::Array(std::vector<Value> values) : Array() {
     _p->items = std::move(values);
 }
 
+const std::vector<Value>& Array::items() const {
+    if (_p->gapCount.load(std::memory_order_acquire) != 0) _p->closeGaps();
+    return _p->items;
+}
+
 size_t Array::count() const {
-    return _p->items.size();
+    const auto turn = _p->turn();
+    return _p->count();
 }
 std::vector<Value>::const_iterator Array::begin() const {
-    return _p->items.begin();
+    return items().begin();
 }
 std::vector<Value>::const_iterator Array::end() const {
-    return _p->items.end();
+    return items().end();
 }
 void Array::reserve(size_t n) {
     _p->items.reserve(n);
 }
 
 const Value& Array::operator[](size_t i) const {
-    if (i >= _p->items.size())
+    if (i >= count())
         throw CXException(kCXRangeException, fmt::format("index {} is beyond the end of an array of {}", i, count()));
-    return _p->items[i];
+    return items()[i];
 }
 
 void Array::append(Value v) {
-    _p->added(v);
     _p->items.push_back(std::move(v));
+    _p->appended();
 }
 
 void Array::appendAll(const Array& other) {
-    const size_t n = other.count(); // other may be this very array
-    _p->items.reserve(_p->items.size() + n);
+    const size_t n = other.items().size(); // other may be this very array
+    const size_t all = _p->items.size() + n;
+    if (all > _p->items.capacity()) _p->items.reserve(std::max(all, _p->items.capacity() * 2));
     for (size_t i = 0; i < n; ++i) append(other._p->items[i]);
 }
 
 void Array::insert(size_t index, Value v) {
+    if (index == count()) return append(std::move(v));
     if (index > count())
         throw CXException(kCXRangeException,
                           fmt::format("index {} is beyond the end of an array of {}", index, count()));
-    _p->added(v);
+    items(); // closes the gaps
+    _p->dropIndex();
     _p->items.insert(_p->items.begin() + static_cast<std::ptrdiff_t>(index), std::move(v));
 }
 
 void Array::replace(size_t index, Value v) {
-    _p->removed((*this)[index]);
-    _p->added(v);
+    (*this)[index];
+    _p->dropIndex();
     _p->items[index] = std::move(v);
 }
 
 void Array::removeAt(size_t index) {
-    _p->removed((*this)[index]);
+    (*this)[index];
+    _p->dropIndex();
     _p->items.erase(_p->items.begin() + static_cast<std::ptrdiff_t>(index));
 }
 
 void Array::removeAll(const Value& v) {
     const Value wanted = v; // NOLINT(performance-unnecessary-copy-initialization): v may live inside this array
-    if (!contains(wanted)) return;
-    std::erase(_p->items, wanted);
-    const std::string* s = wanted.stringIf();
-    if (Storage::Index* built = _p->index.load(); built && s) built->erase(*s);
+    const SharedText* text = wanted.textIf();
+    if (text && _p->isIndexed()) return _p->takeOut(*text);
+    items(); // closes the gaps
+    if (std::erase(_p->items, wanted) != 0) _p->dropIndex();
 }
 
 void Array::removeAllOf(const Array& others) {
     if (others.empty()) return;
     const Array gone = others.isSame(*this) ? others.mutableCopy() : others;
-    const size_t before = count();
-    std::erase_if(_p->items, [&](const Value& v) { return gone.contains(v); });
-    if (count() != before) _p->dropIndex();
+    items(); // closes the gaps
+    if (std::erase_if(_p->items, [&](const Value& v) { return gone.contains(v); }) != 0) _p->dropIndex();
 }
 
 bool Array::contains(const Value& v) const {
-    if (const std::string* s = v.stringIf()) return containsString(*s);
-    return std::find(begin(), end(), v) != end();
+    const SharedText* text = v.textIf();
+    if (!text) return std::find(begin(), end(), v) != end();
+    const auto turn = _p->turn();
+    const auto isIt = [&](const Value& held) { return held.textIf() && *held.textIf() == *text; };
+    if (!_p->isIndexed()) return std::any_of(_p->items.begin(), _p->items.end(), isIt);
+    return _p->indexed().find(text->hash(), [&](uint32_t place) { return isIt(_p->items[place]); });
 }
 
 bool Array::containsString(std::string_view s) const {
-    if (count() >= kIndexFrom) {
-        const auto& index = _p->counted();
-        return index.find(s) != index.end();
-    }
-    return std::any_of(begin(), end(), [&](const Value& v) { return v.stringIf() && *v.stringIf() == s; });
+    const auto turn = _p->turn();
+    const auto isIt = [&](const Value& held) { return held.stringIf() && *held.stringIf() == s; };
+    if (!_p->isIndexed()) return std::any_of(_p->items.begin(), _p->items.end(), isIt);
+    return _p->indexed().find(SharedText::hashOf(s), [&](uint32_t place) { return isIt(_p->items[place]); });
 }
 
 std::optional<size_t> Array::indexOf(const Value& v) const {
@@ -150,14 +248,14 @@ std::optional<size_t> Array::indexOf(const Value& v) const {
 }
 
 Array Array::mutableCopy() const {
-    return Array(_p->items);
+    return Array(items());
 }
 
 bool operator==(const Array& a, const Array& b) {
-    return a._p == b._p || a._p->items == b._p->items;
+    return a._p == b._p || a.items() == b.items();
 }
 
-Dictionary::Dictionary() : _p(std::make_shared<Map>()) {}
+Dictionary::Dictionary() : _p(new Storage) {}
 Dictionary::Dictionary(std::initializer_list<DictionaryEntry> entries) : Dictionary() {
     for (const auto& [key, value] : entries) set(key, value);
 }
@@ -166,45 +264,45 @@ bool Dictionary::isSame(const Dictionary& other) const {
     return _p == other._p;
 }
 size_t Dictionary::count() const {
-    return _p->size();
+    return _p->map.size();
 }
 Dictionary::const_iterator Dictionary::begin() const {
-    return _p->begin();
+    return _p->map.begin();
 }
 Dictionary::const_iterator Dictionary::end() const {
-    return _p->end();
+    return _p->map.end();
 }
 
 const Value& Dictionary::operator[](std::string_view key) const {
-    const auto it = _p->find(key);
-    return it == _p->end() ? kAbsent : it->second;
+    const auto it = _p->map.find(key);
+    return it == _p->map.end() ? kAbsent : it->second;
 }
 
 bool Dictionary::contains(std::string_view key) const {
-    return _p->find(key) != _p->end();
+    return _p->map.find(key) != _p->map.end();
 }
 
 void Dictionary::set(std::string_view key, Value v) {
     if (v.isAbsent())
         throw CXException(kCXInvalidArgumentException,
                           fmt::format("an absent value cannot be stored in a dictionary (key \"{}\")", key));
-    if (auto it = _p->find(key); it != _p->end())
+    if (auto it = _p->map.find(key); it != _p->map.end())
         it->second = std::move(v);
     else
-        _p->emplace(std::string(key), std::move(v));
+        _p->map.emplace(std::string(key), std::move(v));
 }
 
 bool Dictionary::setIfNew(std::string&& key, Value v) {
     if (v.isAbsent())
         throw CXException(kCXInvalidArgumentException,
                           fmt::format("an absent value cannot be stored in a dictionary (key \"{}\")", key));
-    const size_t before = _p->size();
-    _p->try_emplace(_p->end(), std::move(key), std::move(v)); // the hint makes ascending keys cheap
-    return _p->size() != before;
+    const size_t before = _p->map.size();
+    _p->map.try_emplace(_p->map.end(), std::move(key), std::move(v)); // the hint makes ascending keys cheap
+    return _p->map.size() != before;
 }
 
 void Dictionary::remove(std::string_view key) {
-    if (auto it = _p->find(key); it != _p->end()) _p->erase(it);
+    if (auto it = _p->map.find(key); it != _p->map.end()) _p->map.erase(it);
 }
 
 void Dictionary::addEntriesFrom(const Dictionary& other) {
@@ -215,7 +313,7 @@ void Dictionary::addEntriesFrom(const Dictionary& other) {
 std::vector<std::string> Dictionary::allKeys() const {
     std::vector<std::string> keys;
     keys.reserve(count());
-    for (const auto& entry : *_p) keys.push_back(entry.first);
+    for (const auto& entry : _p->map) keys.push_back(entry.first);
     return keys;
 }
 
@@ -235,12 +333,12 @@ Array Dictionary::arrayFor(std::string_view key) {
 
 Dictionary Dictionary::mutableCopy() const {
     Dictionary copy;
-    *copy._p = *_p;
+    copy._p->map = _p->map;
     return copy;
 }
 
 bool operator==(const Dictionary& a, const Dictionary& b) {
-    return a._p == b._p || *a._p == *b._p;
+    return a._p == b._p || a._p->map == b._p->map;
 }
 
 bool Value::boolean(bool otherwise) const {
@@ -270,8 +368,8 @@ double Value::real(double otherwise) const {
 }
 
 const std::string* Value::stringIf() const {
-    const auto* s = std::get_if<std::shared_ptr<const std::string>>(&_v);
-    return s ? s->get() : nullptr;
+    const SharedText* s = textIf();
+    return s ? &s->str() : nullptr;
 }
 
 const std::string& Value::string() const {
@@ -292,8 +390,8 @@ std::optional<Date> Value::date() const {
 
 const Bytes& Value::data() const {
     static const Bytes empty;
-    const auto* b = std::get_if<std::shared_ptr<const Bytes>>(&_v);
-    return b ? **b : empty;
+    const auto* b = std::get_if<SharedPointer<SharedBytes>>(&_v);
+    return b ? (*b)->bytes : empty;
 }
 
 Array Value::array() const {
@@ -383,7 +481,7 @@ bool operator==(const Value& a, const Value& b) {
     if (a.type() == ValueType::real && b.type() == ValueType::integer) return isNumberOf(b.integer(), a.real());
     if (a.type() != b.type()) return false;
     switch (a.type()) {
-    case ValueType::string: return a.string() == b.string();
+    case ValueType::string: return *a.textIf() == *b.textIf();
     case ValueType::data: return a.data() == b.data();
     case ValueType::array: return *a.arrayIf() == *b.arrayIf();
     case ValueType::dictionary: return *a.dictionaryIf() == *b.dictionaryIf();
@@ -398,12 +496,19 @@ Array cxArrayCombinedWithArray(const Array& a, const Array& b) {
     return all;
 }
 
+// What the two have in common at the front and at the back needs no look-up; between equal lists nothing is left.
 Dictionary cxDifferencesBetweenArray(const Array& prior, const Array& current) {
+    const auto same = std::mismatch(prior.begin(), prior.end(), current.begin(), current.end());
+    auto priorEnd = prior.end(), currentEnd = current.end();
+    while (priorEnd != same.first && currentEnd != same.second && *(priorEnd - 1) == *(currentEnd - 1)) {
+        --priorEnd;
+        --currentEnd;
+    }
     Array additions, deletions;
-    for (const Value& v : current)
-        if (!prior.contains(v)) additions.append(v);
-    for (const Value& v : prior)
-        if (!current.contains(v)) deletions.append(v);
+    for (auto v = same.second; v != currentEnd; ++v)
+        if (!prior.contains(*v)) additions.append(*v);
+    for (auto v = same.first; v != priorEnd; ++v)
+        if (!current.contains(*v)) deletions.append(*v);
     return Dictionary{{"additions", additions}, {"deletions", deletions}};
 }
 

@@ -2,6 +2,8 @@
 
 #include "foundation/CXException.h"
 #include "foundation/Date.h"
+#include "foundation/SharedObject.h"
+#include "foundation/SharedText.h"
 
 #include <cstdint>
 #include <initializer_list>
@@ -23,8 +25,9 @@ struct DictionaryEntry;
 using Bytes = std::vector<uint8_t>;
 
 // An ordered list of values, shared by reference: a copy of the handle is the same array. Not locked; one thread at a
-// time unless nobody writes. `contains` and `removeAll` of an absent element are O(1) expected once the array is large:
-// an index of its string elements is built on first need and kept up to date.
+// time unless nobody writes. In a large array `contains` and `removeAll` of a string are O(1) expected: an index of the
+// string elements is built on first need and kept up to date. What `removeAll` takes out leaves a gap that the next
+// look at the order closes, for all removals since the last one.
 class Array {
 public:
     Array();
@@ -56,7 +59,8 @@ public:
 
 private:
     struct Storage;
-    std::shared_ptr<Storage> _p;
+    const std::vector<Value>& items() const; // without gaps
+    SharedPointer<Storage> _p;
 };
 
 // String keys to values, shared by reference like Array. Enumerates in ascending byte order of the keys, always.
@@ -91,7 +95,8 @@ public:
     friend bool operator==(const Dictionary& a, const Dictionary& b); // by content
 
 private:
-    std::shared_ptr<Map> _p;
+    struct Storage;
+    SharedPointer<Storage> _p;
 };
 
 enum class ValueType { absent, boolean, integer, real, string, date, data, array, dictionary };
@@ -111,17 +116,18 @@ public:
     Value(double d) : _v(d) {}
     template <class T, class = std::enable_if_t<!std::is_same_v<std::remove_cv_t<T>, char>>>
     Value(T*) = delete; // or a pointer would become a boolean
-    Value(const char* s) : _v(std::make_shared<const std::string>(s)) {}
-    Value(std::string s) : _v(std::make_shared<const std::string>(std::move(s))) {}
-    Value(std::string_view s) : _v(std::make_shared<const std::string>(s)) {}
+    Value(const char* s) : _v(SharedText(s)) {}
+    Value(std::string s) : _v(SharedText(std::move(s))) {}
+    Value(std::string_view s) : _v(SharedText(std::string(s))) {}
+    Value(SharedText s) : _v(std::move(s)) {}
     Value(Date d) : _v(d) {}
-    Value(Bytes b) : _v(std::make_shared<const Bytes>(std::move(b))) {}
+    Value(Bytes b) : _v(SharedPointer<SharedBytes>(new SharedBytes(std::move(b)))) {}
     Value(Array a) : _v(std::move(a)) {}
     Value(Dictionary d) : _v(std::move(d)) {}
-    // A strong string is stored as its text.
-    template <class S, class = decltype(std::declval<const S&>().str()),
+    // A strong string is stored as its text, which the two share.
+    template <class S, class = decltype(std::declval<const S&>().text()),
               class = std::enable_if_t<!std::is_convertible_v<S, std::string>>>
-    Value(const S& s) : Value(s.str()) {}
+    Value(const S& s) : Value(s.text()) {}
 
     ValueType type() const { return static_cast<ValueType>(_v.index()); }
     bool isAbsent() const { return type() == ValueType::absent; }
@@ -146,6 +152,7 @@ public:
     const Array* arrayIf() const { return std::get_if<Array>(&_v); }
     const Dictionary* dictionaryIf() const { return std::get_if<Dictionary>(&_v); }
     const std::string* stringIf() const;
+    const SharedText* textIf() const { return std::get_if<SharedText>(&_v); }
 
     Value deepMutableCopy() const; // every container inside is new; leaves are shared (they are immutable)
 
@@ -156,8 +163,11 @@ public:
     friend bool operator==(const Value& a, const Value& b);
 
 private:
-    std::variant<std::monostate, bool, int64_t, double, std::shared_ptr<const std::string>, Date,
-                 std::shared_ptr<const Bytes>, Array, Dictionary>
+    struct SharedBytes : SharedObject {
+        explicit SharedBytes(Bytes b) : bytes(std::move(b)) {}
+        const Bytes bytes;
+    };
+    std::variant<std::monostate, bool, int64_t, double, SharedText, Date, SharedPointer<SharedBytes>, Array, Dictionary>
         _v;
 };
 

@@ -57,7 +57,7 @@ Value valueOf(const std::optional<Strong>& text) {
 
 template <class Strong>
 std::optional<Strong> strongOf(const Value& value) {
-    const std::string* text = value.stringIf();
+    const SharedText* text = value.textIf();
     return text ? std::optional<Strong>(Strong(*text)) : std::nullopt;
 }
 
@@ -70,40 +70,62 @@ std::optional<Strong> strongOf(const Value& value) {
 void appendOnce(Dictionary& payload, const char* key, const std::optional<UniqueId>& member) {
     if (!member) return;
     Array list = payload.arrayFor(key);
-    if (!list.containsString(member->str())) list.append(*member);
+    const Value identifier(*member);
+    if (!list.contains(identifier)) list.append(identifier);
 }
 
 } // namespace
 
 // Either form, or both after a look inside: then the value counts, because whoever holds it may have changed it.
 // The lock guards the fields only; copies of one record may be looked at side by side.
-struct CXDChangeRecord::Payload {
-    mutable std::mutex lock;
-    Value value;
-    std::shared_ptr<const Bytes> encoded;
+struct CXDChangeRecord::Payload : SharedObject {
+    explicit Payload(Value v) : value(std::move(v)) {}
+    explicit Payload(std::shared_ptr<const Bytes> bytes) : encoded(std::move(bytes)) {}
 
     Value decoded() {
-        const std::lock_guard guard(lock);
+        const std::lock_guard guard(lock());
         if (!value && encoded) value = BinaryValue::decode(*encoded);
         return value;
     }
     std::shared_ptr<const Bytes> untouched() const {
-        const std::lock_guard guard(lock);
+        const std::lock_guard guard(lock());
         return value ? nullptr : encoded;
     }
     Bytes bytes() const {
-        const std::lock_guard guard(lock);
+        const std::lock_guard guard(lock());
         if (value) return BinaryValue::encode(value);
         return encoded ? *encoded : Bytes();
     }
     void pack() {
-        const std::lock_guard guard(lock);
+        const std::lock_guard guard(lock());
         if (!value) return;
         Bytes now = BinaryValue::encode(value);
         if (!encoded || *encoded != now) encoded = std::make_shared<const Bytes>(std::move(now));
         value = Value();
     }
+
+private:
+    // A few locks for all: one in each of a hundred thousand payloads would be memory for nothing.
+    std::mutex& lock() const {
+        static std::array<std::mutex, 32> all;
+        return all[(reinterpret_cast<uintptr_t>(this) >> 6) % all.size()];
+    }
+    Value value;
+    std::shared_ptr<const Bytes> encoded;
 };
+
+struct CXDChangeRecord::Delayed {
+    Url url;
+    CXFileManager* manager;
+};
+
+CXDChangeRecord::CXDChangeRecord() = default;
+CXDChangeRecord::~CXDChangeRecord() = default;
+CXDChangeRecord::CXDChangeRecord(const CXDChangeRecord& other)
+    : _changeType(other._changeType), _initialSource(other._initialSource), _appliesToSources(other.appliesToSources()),
+      _appliedToSources(other._appliedToSources), _puid(other._puid), _guid(other._guid), _user(other._user),
+      _payload(other._payload), _delayed(other._delayed ? std::make_unique<Delayed>(*other._delayed) : nullptr),
+      _delayedPayloadWasRead(other._delayedPayloadWasRead) {}
 
 CXDChangeRecord::CXDChangeRecord(int32_t initialSource, int32_t type, std::optional<UserName> user,
                                  std::optional<UniqueId> person, std::optional<UniqueId> group, Value payload)
@@ -113,29 +135,22 @@ CXDChangeRecord::CXDChangeRecord(int32_t initialSource, int32_t type, std::optio
 }
 
 void CXDChangeRecord::setPayload(Value payload) {
-    _payload.reset();
-    if (!payload) return;
-    _payload = std::make_shared<Payload>();
-    _payload->value = std::move(payload);
+    _payload = payload ? SharedPointer<Payload>(new Payload(std::move(payload))) : SharedPointer<Payload>();
 }
 
 void CXDChangeRecord::setEncodedPayload(std::shared_ptr<const Bytes> encoded) {
-    _payload.reset();
-    if (!encoded) return;
-    _payload = std::make_shared<Payload>();
-    _payload->encoded = std::move(encoded);
+    _payload = encoded ? SharedPointer<Payload>(new Payload(std::move(encoded))) : SharedPointer<Payload>();
 }
 
 void CXDChangeRecord::setDelayedPayloadURL(const Url& url, CXFileManager* manager) {
-    if (_delayedPayloadURL == url) return;
-    _delayedPayloadURL = url;
-    _fileManager = manager;
+    if (_delayed && _delayed->url == url) return;
+    _delayed = std::make_unique<Delayed>(Delayed{url, manager});
 }
 
 Value CXDChangeRecord::payload() {
-    if (!_delayedPayloadURL || !_fileManager) return inMemoryPayload();
+    if (!_delayed || !_delayed->manager) return inMemoryPayload();
     int ignored = 0;
-    const std::optional<Dictionary> fetched = _fileManager->dictionaryAtURL(*_delayedPayloadURL, &ignored, true);
+    const std::optional<Dictionary> fetched = _delayed->manager->dictionaryAtURL(_delayed->url, &ignored, true);
     const Value held = inMemoryPayload();
     if (!fetched) return held;
     _delayedPayloadWasRead = true;
@@ -150,7 +165,7 @@ Value CXDChangeRecord::inMemoryPayload() const {
 }
 
 std::shared_ptr<const Bytes> CXDChangeRecord::encodedPayload() const {
-    return _payload && !_delayedPayloadURL ? _payload->untouched() : nullptr;
+    return _payload && !_delayed ? _payload->untouched() : nullptr;
 }
 
 void CXDChangeRecord::packPayload() {
@@ -207,9 +222,10 @@ CXDChangeRecord::CXDChangeRecord(const Coder& coder) {
     _guid = strongOf<UniqueId>(coder.decodeObject(kGroupKey));
     _user = strongOf<UserName>(coder.decodeObject(kUserKey));
     const Value payload = coder.decodeObject(kPayloadKey);
-    if (payload.isData())
-        setEncodedPayload(std::make_shared<const Bytes>(payload.data()));
-    else
+    if (payload.isData()) {
+        const auto held = std::make_shared<const Value>(payload);
+        setEncodedPayload(std::shared_ptr<const Bytes>(held, &held->data())); // the very bytes of the value
+    } else
         setPayload(payload);
 }
 
@@ -221,10 +237,8 @@ CXDChangeRecordPtr CXDChangeRecord::copy() const {
 }
 
 CXDChangeRecords CXDChangeRecord::splitChangeRecord() const {
-    // The peer source has no conduit: its bit is not split out.
-    constexpr std::array order = {CXDSyncSourceLocal, CXDSyncSourceVaultra, CXDSyncSourceCX, CXDSyncSourcePending};
     CXDChangeRecords parts;
-    for (const int32_t source : order) {
+    for (const int32_t source : kSplitOrder) {
         if (!(_appliesToSources & source)) continue;
         parts.push_back(copy());
         parts.back()->setAppliesToSources(source);

@@ -1,10 +1,12 @@
 #pragma once
 
 #include "foundation/KeyedArchive.h"
+#include "foundation/SharedObject.h"
 #include "foundation/StrongString.h"
 #include "foundation/Url.h"
 #include "foundation/Value.h"
 
+#include <array>
 #include <atomic>
 #include <compare>
 #include <cstdint>
@@ -63,7 +65,10 @@ using CXDChangeRecords = std::vector<CXDChangeRecordPtr>;
 // between lists; copies share the payload object. Carries no lock: one thread at a time.
 class CXDChangeRecord {
 public:
-    CXDChangeRecord() = default; // every field zero or absent
+    CXDChangeRecord(); // every field zero or absent
+    ~CXDChangeRecord();
+    CXDChangeRecord(const CXDChangeRecord& other); // all of it, the masks and the delayed payload's place too
+    CXDChangeRecord& operator=(const CXDChangeRecord&) = delete;
     // initWithInitialSource:type:user:person:group:payload:. Both masks start at 0.
     CXDChangeRecord(int32_t initialSource, int32_t type, std::optional<UserName> user, std::optional<UniqueId> person,
                     std::optional<UniqueId> group, Value payload = {});
@@ -94,6 +99,7 @@ public:
     // The payload's bytes while it has no delayed part and nobody has looked inside; null otherwise. Whoever needs the
     // content once decodes a tree of its own from them, and none stays in the record.
     std::shared_ptr<const Bytes> encodedPayload() const;
+    bool hasDelayedPayload() const { return _delayed != nullptr; }
     // Turns a decoded payload back into its encoded form, what was changed in it included, and lets the tree go; a
     // payload that was given as a value is encoded too. For a record that has been handled but must be kept: many of
     // them then stand in memory as bytes. Who still holds the former value holds a tree of its own from then on.
@@ -109,7 +115,11 @@ public:
     explicit CXDChangeRecord(const Coder& coder); // initWithCoder:
     CXDChangeRecordPtr copy() const;              // shares the payload object; applied-to 0, no delayed payload
 
+    // One copy for each source of the mask, in the order of kSplitOrder. The peer source has no conduit: its bit is not
+    // split out.
     CXDChangeRecords splitChangeRecord() const;
+    static constexpr std::array<int32_t, 4> kSplitOrder = {CXDSyncSourceLocal, CXDSyncSourceVaultra, CXDSyncSourceCX,
+                                                           CXDSyncSourcePending};
     // Folds `other` into this record's payload and makes this record a composite. kCXInvalidArgumentException, before
     // anything has changed, when `other` cannot be merged or this record's payload is not a dictionary.
     void mergeWithGroupChangeRecord(CXDChangeRecord& other);
@@ -132,6 +142,7 @@ private:
         }
     };
     struct Payload; // shared by copies: the value, or its encoded form until it is first read
+    struct Delayed; // few records have one, and there are many records
     int32_t _changeType = 0;
     int32_t _initialSource = 0;
     Mask _appliesToSources{0};
@@ -139,9 +150,8 @@ private:
     std::optional<UniqueId> _puid;
     std::optional<UniqueId> _guid;
     std::optional<UserName> _user;
-    std::shared_ptr<Payload> _payload;
-    std::optional<Url> _delayedPayloadURL;
-    CXFileManager* _fileManager = nullptr;
+    SharedPointer<Payload> _payload;
+    std::unique_ptr<Delayed> _delayed;
     bool _delayedPayloadWasRead = false;
 };
 

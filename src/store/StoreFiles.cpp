@@ -13,6 +13,8 @@ namespace rolvane {
 namespace {
 
 constexpr std::string_view kMakingSuffix = ".making";
+// What is read here becomes part of larger values, which must still be shallow enough to be written.
+constexpr PropertyListLimits kReadLimits{.maxDepth = 48};
 constexpr size_t kMaxKnownCollections = 20000;
 constexpr int kOk = 200;
 
@@ -135,7 +137,7 @@ StoreFiles::Fetched StoreFiles::fetch(const Url& url, bool mayBeCollection) {
         out.version = versionOf(answer);
         out.found = Found::noDictionary;
         try {
-            const Value value = PropertyList::fromXML(answer.body);
+            const Value value = PropertyList::fromXML(answer.body, kReadLimits);
             if (const Dictionary* d = value.dictionaryIf()) {
                 out.dictionary = *d;
                 out.found = Found::dictionary;

@@ -78,6 +78,52 @@ TEST(Scan, GivesRowsWithTheirParentGroupsOverManyPages) {
     EXPECT_EQ(members, 602u);
 }
 
+TEST(Scan, GivesTheRowsOfEverybodyInMemberOrderSavedOrNot) {
+    TestDatabase d;
+    CXGroupRef odd = d.addGroup("Odd");
+    for (int i = 0; i < 1001; i++) {
+        CXPersonRef p = d.addPerson(std::to_string(i));
+        if (i % 2 != 0) odd->addMember(p);
+    }
+    const auto compare = [&](const CXGroup& group) {
+        std::vector<UniqueId> seen;
+        d->forEachMember(group, [&](const CXRow& row) {
+            auto person = std::dynamic_pointer_cast<CXPerson>(d->recordForUniqueId(row.uniqueId));
+            EXPECT_EQ(row.parentGroups, person->parentGroupUniqueIds());
+            EXPECT_EQ(*row.encoded, *person->encodedRepresentation());
+            EXPECT_EQ(row.writer, d->programName());
+            seen.push_back(row.uniqueId);
+        });
+        EXPECT_EQ(seen, group.memberUniqueIds());
+    };
+    for (const bool saved : {false, true}) {
+        if (saved) d->save();
+        compare(*odd);
+        compare(*d->allGroup());
+    }
+    EXPECT_EQ(d->peopleOfTable(kCXPersonTable), d->allGroup()->memberUniqueIds());
+    EXPECT_TRUE(d->peopleOfTable(kCXSubscribedPersonTable).empty());
+}
+
+TEST(Scan, MembersThatTheCallbackChangesOrRemovesAreGivenAsTheyAreThen) {
+    TestDatabase d;
+    CXGroupRef all = d.addGroup("All");
+    std::vector<CXPersonRef> people;
+    for (int i = 0; i < 4; i++) {
+        people.push_back(d.addPerson(std::to_string(i)));
+        all->addMember(people.back());
+    }
+    d->save();
+    std::vector<std::string> names;
+    d->forEachMember(*all, [&](const CXRow& row) {
+        names.push_back(BinaryValue::decode(*row.encoded).dictionary()[kCXFirstNameProperty].string());
+        if (names.size() != 1) return;
+        people[1]->setValue("changed", kCXFirstNameProperty);
+        d->removeRecord(people[2]);
+    });
+    EXPECT_EQ(names, (std::vector<std::string>{"0", "changed", "3"}));
+}
+
 TEST(Scan, KeepsSubscribedPeopleApart) {
     TestDatabase d;
     d.addPerson("Mine");

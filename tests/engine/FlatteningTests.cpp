@@ -149,5 +149,14 @@ TEST(Flattening, OneLargeGroupCostsInProportionToItsChanges) {
     EXPECT_LT(seconds(20000), 40 * small);
 }
 
+RC_GTEST_PROP(Flattening, SortingByTypeIsTheStableSortOfTheComparison, ()) {
+    auto records = *rc::gen::container<CXDChangeRecords>(test::arbitraryRecord());
+    CXDChangeRecords expected = records;
+    std::stable_sort(expected.begin(), expected.end(),
+                     [](const CXDChangeRecordPtr& a, const CXDChangeRecordPtr& b) { return a->compare(*b) < 0; });
+    sortByType(records);
+    RC_ASSERT(test::identities(records) == test::identities(expected));
+}
+
 } // namespace
 } // namespace rolvane

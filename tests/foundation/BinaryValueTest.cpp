@@ -112,5 +112,18 @@ TEST(BinaryValueTest, HoldsTheDepthLimitInBothDirections) {
     self.remove("self"); // or it would never be freed
 }
 
+// Large data goes in and out without a copy, in the same form.
+RC_GTEST_PROP(BinaryValueTest, DataInPlaceHasTheFormOfADataValue, ()) {
+    const Bytes data(*rc::gen::inRange<size_t>(0, 300), *rc::gen::arbitrary<uint8_t>());
+    const Bytes encoded = BinaryValue::encodeData(data);
+    RC_ASSERT(encoded == BinaryValue::encode(Value(data)));
+    RC_ASSERT(BinaryValue::decode(Bytes(encoded)) == Value(data));
+    for (const size_t size : {encoded.size() - 1, encoded.size() + 1}) {
+        Bytes broken = encoded;
+        broken.resize(size);
+        RC_ASSERT_THROWS_AS(BinaryValue::decode(std::move(broken)), CXException);
+    }
+}
+
 } // namespace
 } // namespace rolvane

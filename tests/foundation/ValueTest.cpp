@@ -100,6 +100,48 @@ RC_GTEST_PROP(ArrayTest, ContainsAgreesWithALinearSearchAfterAnyChanges, ()) {
     }
 }
 
+// Removals leave gaps until somebody looks at the order: nothing that does not look at it may notice them.
+RC_GTEST_PROP(ArrayTest, RemovalsThatNobodyHasLookedAtYetKeepTheOrder, ()) {
+    Array a = strings(0, 60);
+    std::vector<Value> expected(a.begin(), a.end());
+    for (int steps = *rc::gen::inRange(1, 80); steps > 0; --steps) {
+        const Value v = "s" + std::to_string(*rc::gen::inRange(0, 70));
+        switch (*rc::gen::inRange(0, 5)) {
+        case 0:
+        case 1:
+            a.append(v);
+            expected.push_back(v);
+            break;
+        default: a.removeAll(v); std::erase(expected, v);
+        }
+        const Value asked = "s" + std::to_string(*rc::gen::inRange(0, 70));
+        const bool there = std::find(expected.begin(), expected.end(), asked) != expected.end();
+        RC_ASSERT(a.count() == expected.size());
+        RC_ASSERT(a.contains(asked) == there);
+        RC_ASSERT(a.containsString(asked.string()) == there);
+    }
+    RC_ASSERT(a == Array(expected));
+    RC_ASSERT(a.mutableCopy() == a);
+}
+
+TEST(ArrayTest, SeveralThreadsMayBeTheFirstToLookAfterRemovals) {
+    const Array a = [] {
+        Array made = strings(0, 2000);
+        for (int i = 0; i < 2000; i += 2) made.removeAll("s" + std::to_string(i));
+        return made;
+    }();
+    std::vector<std::thread> threads;
+    std::atomic<size_t> found{0};
+    for (int t = 0; t < 4; ++t)
+        threads.emplace_back([&, t] {
+            for (int i = 0; i < 200; ++i) found += a.containsString("s" + std::to_string(i)) ? 1 : 0;
+            if (t % 2 == 0) found += static_cast<size_t>(std::distance(a.begin(), a.end()));
+            found += a.count();
+        });
+    for (std::thread& t : threads) t.join();
+    EXPECT_EQ(found, 4 * 100 + 2 * 1000 + 4 * 1000u);
+}
+
 TEST(ArrayTest, SeveralThreadsMayAskALargeArrayForTheFirstTime) {
     const Array a = strings(0, 2000);
     std::vector<std::thread> threads;
@@ -254,6 +296,13 @@ RC_GTEST_PROP(ValueTest, DifferencesAreThoseOfTheLiteralDefinition, ()) {
     RC_ASSERT(d["additions"].array() == array(onlyIn(after, before)));
     RC_ASSERT(d["deletions"].array() == array(onlyIn(before, after)));
     RC_ASSERT(d.count() == 2u);
+}
+
+TEST(StrongStringTest, SharesItsTextWithTheValueMadeOfIt) {
+    const UserName name("somebody with a long name");
+    const Value value(name);
+    EXPECT_EQ(&value.string(), &name.str());
+    EXPECT_EQ(&UserName(*value.textIf()).str(), &name.str());
 }
 
 TEST(StrongStringTest, TwoKindsCannotBeSwapped) {

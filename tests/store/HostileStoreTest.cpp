@@ -1,4 +1,5 @@
 #include "StoreWorld.h"
+#include "foundation/PropertyList.h"
 #include "store/StoreLock.h"
 #include "support/CapturingLog.h"
 
@@ -62,6 +63,32 @@ TEST(HostileStore, ForbiddenAndAbsentAreBelievedFromAWebDAVServer) {
         int code = -1;
         EXPECT_FALSE(s.manager->dictionaryAtURL(s.base.cxURLByAppendingComponent("info"), false, &code));
         EXPECT_EQ(code, status);
+    }
+}
+
+std::string nestedDictionaries(int depth) {
+    std::string opening, closing;
+    for (int i = 1; i < depth; ++i) {
+        opening += "<dict><key>k</key>";
+        closing += "</dict>";
+    }
+    return "<plist version=\"1.0\">" + opening + "<dict/>" + closing + "</plist>";
+}
+
+// What a store says becomes part of the prior state, some containers further in, and that must still be written.
+TEST(HostileStore, ADictionaryThatIsNestedTooDeepToBeKeptIsNone) {
+    for (const int depth : {48, 49, 64}) {
+        Scripted s([=](const HttpRequest& r) {
+            return r.method == "OPTIONS" ? kDavOptions : answerOf(200, {}, nestedDictionaries(depth));
+        });
+        int code = -1;
+        const auto read = s.manager->dictionaryAtURL(s.base.cxURLByAppendingComponent("info"), false, &code);
+        EXPECT_EQ(read.has_value(), depth == 48) << depth;
+        if (!read) continue;
+        Value kept = *read;
+        for (int i = 0; i < 8; ++i) kept = Dictionary{{"level", kept}};
+        EXPECT_NO_THROW(PropertyList::toXML(kept));
+        EXPECT_NO_THROW(BinaryValue::encode(kept));
     }
 }
 
