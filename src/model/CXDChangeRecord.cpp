@@ -147,6 +147,14 @@ void CXDChangeRecord::setDelayedPayloadURL(const Url& url, CXFileManager* manage
     _delayed = std::make_unique<Delayed>(Delayed{url, manager});
 }
 
+std::optional<Url> CXDChangeRecord::delayedPayloadURL() const {
+    return _delayed ? std::optional(_delayed->url) : std::nullopt;
+}
+
+CXFileManager* CXDChangeRecord::fileManager() const {
+    return _delayed ? _delayed->manager : nullptr;
+}
+
 Value CXDChangeRecord::payload() {
     if (!_delayed || !_delayed->manager) return inMemoryPayload();
     int ignored = 0;

@@ -91,8 +91,8 @@ public:
     // Reads the delayed payload afresh at every call and lays the in-memory entries over it; a failed read gives the
     // in-memory payload. Without a delayed payload: the in-memory one, absent when there is none.
     Value payload();
-    const std::optional<Url>& delayedPayloadURL() const { return _delayedPayloadURL; }
-    CXFileManager* fileManager() const { return _fileManager; } // of the delayed payload; none without one
+    std::optional<Url> delayedPayloadURL() const;
+    CXFileManager* fileManager() const; // of the delayed payload; none without one
     // Has a call of payload() read the delayed payload? What is in memory alone may be no more than a stamp.
     bool delayedPayloadWasRead() const { return _delayedPayloadWasRead; }
     Value inMemoryPayload() const; // never reads the URL
