@@ -2,6 +2,7 @@
 #include "Lookup.h"
 #include "PersonFields.h"
 #include "RecordJson.h"
+#include "Subscriptions.h"
 
 #include "contacts/VCardExport.h"
 #include "contacts/VCardImport.h"
@@ -19,17 +20,6 @@ namespace rolvane::cli {
 namespace {
 
 using Json = nlohmann::ordered_json;
-
-// A copy that came by a subscription belongs to somebody else; without the right to write it cannot be changed here.
-void refuseReadOnly(CXRecord& record, const std::string& name) {
-    if (!record.isSubscribed()) return;
-    const CXAllGroupRef all = record.rolvane()->allGroupForRemoteLocation(record.remoteLocation());
-    const auto writers = all ? all->multiValueForProperty(kCXReadWriteSharingACLProperty) : std::nullopt;
-    if (writers && !writers->empty()) return;
-    throw CommandError(kRefused, fmt::format("\"{}\" is a copy from {}, which may be read but not changed. Ask its "
-                                             "owner for the right to write.",
-                                             name, record.remoteLocation().str()));
-}
 
 // import ---------------------------------------------------------------------------------------------------------
 
@@ -160,11 +150,12 @@ void exportCards(Context& context, const ExportOptions& options) {
 struct ListOptions {
     std::string text, group;
     bool full = false;
+    Whose whose;
 };
 
 std::vector<CXListing> chosenPeople(Context& context, const ListOptions& options) {
     CXRolvane& database = context.database();
-    std::vector<CXListing> people = database.listPeople(std::nullopt, options.text);
+    std::vector<CXListing> people = database.listPeople(locationOf(database, options.whose), options.text);
     if (options.group.empty()) return people;
     const auto members = findGroup(database, options.group)->memberUniqueIds();
     const std::set<UniqueId> wanted(members.begin(), members.end());
@@ -176,8 +167,7 @@ void list(Context& context, const ListOptions& options) {
     const std::vector<CXListing> people = chosenPeople(context, options);
     if (!context.json) {
         for (const CXListing& person : people)
-            context.line(fmt::format("{}  {}{}", person.uniqueId.str(), person.displayName,
-                                     person.location.empty() ? "" : "  [" + person.location.str() + "]"));
+            context.line(fmt::format("{}  {}{}", person.uniqueId.str(), person.displayName, ownerMark(person)));
         return;
     }
     // Written one by one: a document of 100,000 people with photos need not stand in memory.
@@ -193,7 +183,8 @@ void list(Context& context, const ListOptions& options) {
         } else {
             data = {{"identifier", listed.uniqueId.str()},
                     {"name", listed.displayName},
-                    {"location", listed.location.empty() ? Json() : Json(listed.location.str())}};
+                    {"location", listed.location.empty() ? Json() : Json(listed.location.str())},
+                    {"owner", ownerJson(listed.location)}};
         }
         context.line(std::string(first ? "  " : ", ") + data.dump(-1, ' ', false, Json::error_handler_t::replace));
         first = false;
@@ -226,7 +217,7 @@ void tell(Context& context, CXPerson& person, const std::string& done) {
 void add(Context& context, const PersonFields& fields, const std::vector<std::string>& groups) {
     CXRolvane& database = context.database();
     std::vector<CXGroupRef> joined;
-    for (const std::string& group : groups) joined.push_back(findGroup(database, group));
+    for (const std::string& group : groups) joined.push_back(findChangeableGroup(database, group));
     const CXPersonRef person = CXPerson::create();
     fields.applyTo(*person);
     if (person->cxUsedProperties().empty())
@@ -239,7 +230,7 @@ void add(Context& context, const PersonFields& fields, const std::vector<std::st
 
 void edit(Context& context, const std::string& name, const PersonFields& fields) {
     const CXPersonRef person = findPerson(context.database(), name);
-    refuseReadOnly(*person, person->displayName());
+    requireWritable(*person);
     fields.applyTo(*person);
     const bool changed = context.database().hasUnsavedChanges();
     context.database().save();
@@ -261,7 +252,7 @@ void remove(Context& context, const std::vector<std::string>& names, bool yes) {
     std::vector<CXPersonRef> people;
     for (const std::string& name : names) {
         people.push_back(findPerson(database, name, true));
-        refuseReadOnly(*people.back(), people.back()->displayName());
+        requireWritable(*people.back());
     }
     const std::string question = people.size() == 1 ? fmt::format("Delete {}?", people[0]->displayName())
                                                     : fmt::format("Delete {} people?", people.size());
@@ -301,6 +292,7 @@ void addContactCommands(CLI::App& app, Context& context) {
         [&](CLI::App& command) {
             command.add_option("text", lists->text, "Only those with this text in name, organisation, mail or phone");
             command.add_option("-g,--group", lists->group, "Only members of this group");
+            declareWhose(command, lists->whose);
             command.add_flag("--full", lists->full, "With --json: every property");
         },
         [&context, lists] { list(context, *lists); });

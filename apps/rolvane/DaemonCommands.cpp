@@ -1,6 +1,7 @@
 #include "Context.h"
 #include "PassWatch.h"
 #include "Publication.h"
+#include "Subscriptions.h"
 
 #include "daemon/DaemonControl.h"
 #include "engine/EngineState.h"
@@ -62,9 +63,10 @@ Json status(Context& context) {
     Json groups = Json::array(), subscriptions = Json::array();
     for (const CXGroupRef& group : publication.groups())
         groups.push_back({{"identifier", group->uniqueId().str()}, {"name", group->name()}});
-    for (const CXSubscriptionRef& s : database.subscriptions())
-        if (!s->isLocal() && s->remoteLocation() != RemoteLocation(Publication::kGroupsLocation))
-            subscriptions.push_back({{"location", s->remoteLocation().str()}, {"name", s->name()}});
+    for (const CXSubscriptionRef& s : subscriptionsToPeople(database))
+        subscriptions.push_back({{"user", publisherOf(s->remoteLocation())},
+                                 {"location", s->remoteLocation().str()},
+                                 {"writable", s->isWritable()}});
     const auto pid = DaemonControl().running();
     return {{"people", database.countPeople(RemoteLocation(""))},
             {"groups", database.listGroups(RemoteLocation("")).size()},
@@ -84,6 +86,14 @@ std::string publishedText(const Json& published) {
     for (const Json& group : published["groups"])
         names += (names.empty() ? "" : ", ") + group["name"].get<std::string>();
     return (published["groups"].size() == 1 ? "the group " : "the groups ") + names;
+}
+
+std::string subscribedText(const Json& subscriptions) {
+    std::string text;
+    for (const Json& s : subscriptions)
+        text += (text.empty() ? "to " : ", ") + s["user"].get<std::string>() +
+                (s["writable"].get<bool>() ? " (read and write)" : "");
+    return text.empty() ? "to nobody" : text;
 }
 
 void showStatus(Context& context) {
@@ -106,7 +116,7 @@ void showStatus(Context& context) {
                                                : "cannot be used: " + store["reason"].get<std::string>());
     }
     row("Published", publishedText(s["published"]));
-    row("Subscriptions", fmt::format("{}", s["subscriptions"].size()));
+    row("Subscribed", subscribedText(s["subscriptions"]));
     row("Waiting", fmt::format("{} change{}", pending, pending == 1 ? "" : "s"));
     row("Last pass", s["lastPass"].is_null() ? "never" : s["lastPass"].get<std::string>());
 }

@@ -13,7 +13,8 @@ const std::map<std::string, const char*>& examples() {
         {"export", "  rolvane export -o everybody.vcf\n"
                    "  rolvane export --group Family --vcard 3 > family.vcf"},
         {"list", "  rolvane list miller\n"
-                 "  rolvane list --group Family --json --full"},
+                 "  rolvane list --group Family --json --full\n"
+                 "  rolvane list --of bob"},
         {"show", "  rolvane show \"Ada Miller\"\n"
                  "  rolvane show 4CA70A2B --json"},
         {"add", "  rolvane add --first Ada --last Miller --phone \"mobile:+1 555 0100\" --group Family"},
@@ -34,6 +35,12 @@ const std::map<std::string, const char*>& examples() {
                     "  rolvane publish --group Family"},
         {"unpublish", "  rolvane unpublish --group Family\n"
                       "  rolvane unpublish --keep"},
+        {"subscribe", "  rolvane subscribe bob\n"
+                      "  rolvane subscribe http://dav.example.org/bob/Contacts --no-wait"},
+        {"unsubscribe", "  rolvane unsubscribe bob"},
+        {"subscriptions", "  rolvane subscriptions\n"
+                          "  rolvane subscriptions --json"},
+        {"group list", "  rolvane group list --of bob"},
         {"sync", "  rolvane sync --timeout 60"},
         {"daemon", "  rolvane daemon start\n"
                    "  rolvane daemon status --json"},

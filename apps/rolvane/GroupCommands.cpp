@@ -2,6 +2,7 @@
 #include "Lookup.h"
 #include "Publication.h"
 #include "RecordJson.h"
+#include "Subscriptions.h"
 
 #include "contacts/Constants.h"
 
@@ -21,32 +22,17 @@ struct GroupOptions {
     bool clear = false, yes = false;
 };
 
-// The owner's own groups can be changed; a copy from a subscription only with the right to write.
-CXGroupRef changeableGroup(CXRolvane& database, const std::string& named, bool whole = false) {
-    const CXGroupRef group = findGroup(database, named, whole);
-    if (group->isAllGroup())
-        throw CommandError(kRefused, fmt::format("\"{}\" holds everybody; its members are not chosen.", group->name()));
-    if (!group->isSubscribed()) return group;
-    const CXAllGroupRef all = database.allGroupForRemoteLocation(group->remoteLocation());
-    const auto writers = all ? all->multiValueForProperty(kCXReadWriteSharingACLProperty) : std::nullopt;
-    if (!writers || writers->empty())
-        throw CommandError(kRefused, fmt::format("\"{}\" is a copy from {}, which may be read but not changed.",
-                                                 group->name(), group->remoteLocation().str()));
-    return group;
-}
-
-void listGroups(Context& context) {
+void listGroups(Context& context, const Whose& whose) {
     CXRolvane& database = context.database();
     Json all = Json::array();
-    for (const CXListing& listing : database.listGroups(std::nullopt)) {
+    for (const CXListing& listing : database.listGroups(locationOf(database, whose))) {
         const auto group = std::dynamic_pointer_cast<CXGroup>(database.recordForUniqueId(listing.uniqueId));
         if (!group) continue;
         if (context.json)
             all.push_back(toJson(*group));
         else
             context.line(fmt::format("{}  {}  ({} members, {} groups){}", group->uniqueId().str(), group->name(),
-                                     group->memberCount(), group->subgroupUniqueIds().size(),
-                                     listing.location.empty() ? "" : "  [" + listing.location.str() + "]"));
+                                     group->memberCount(), group->subgroupUniqueIds().size(), ownerMark(listing)));
     }
     if (context.json) context.print(all);
 }
@@ -64,6 +50,7 @@ void showGroup(Context& context, const std::string& named) {
     if (context.json) return context.print(toJson(*group));
     context.line(group->name());
     context.line(fmt::format("{:<18}{}", "Identifier", group->uniqueId().str()));
+    if (group->isSubscribed()) context.line(fmt::format("{:<18}{}", "From", fromText(*group)));
     const auto choices = group->distributionChoices();
     for (const UniqueId& uid : group->subgroupUniqueIds())
         context.line(fmt::format("{:<18}{}", "Group", nameOf(database, uid)));
@@ -100,7 +87,7 @@ void createGroup(Context& context, const GroupOptions& options) {
 }
 
 void renameGroup(Context& context, const GroupOptions& options) {
-    const CXGroupRef group = changeableGroup(context.database(), options.group);
+    const CXGroupRef group = findChangeableGroup(context.database(), options.group);
     const std::string former = group->name();
     if (!group->setValue(options.name, kCXGroupNameProperty)) throw CommandError(kUsage, "A group needs a name.");
     context.database().save();
@@ -108,7 +95,7 @@ void renameGroup(Context& context, const GroupOptions& options) {
 }
 
 void deleteGroup(Context& context, const GroupOptions& options) {
-    const CXGroupRef group = changeableGroup(context.database(), options.group, true);
+    const CXGroupRef group = findChangeableGroup(context.database(), options.group, true);
     const std::string name = group->name();
     const Publication publication(context.database());
     if (!publication.everything() && publication.publishes(group))
@@ -123,7 +110,7 @@ void deleteGroup(Context& context, const GroupOptions& options) {
 // Adds or removes members, all or none.
 void changeMembers(Context& context, const GroupOptions& options, bool adding) {
     CXRolvane& database = context.database();
-    const CXGroupRef group = changeableGroup(database, options.group);
+    const CXGroupRef group = findChangeableGroup(database, options.group);
     std::vector<CXPersonRef> people;
     for (const std::string& name : options.names) people.push_back(findPerson(database, name));
     size_t changed = 0;
@@ -136,7 +123,7 @@ void changeMembers(Context& context, const GroupOptions& options, bool adding) {
 
 void changeSubgroups(Context& context, const GroupOptions& options, bool adding) {
     CXRolvane& database = context.database();
-    const CXGroupRef group = changeableGroup(database, options.group);
+    const CXGroupRef group = findChangeableGroup(database, options.group);
     std::vector<CXGroupRef> subgroups;
     for (const std::string& name : options.names) subgroups.push_back(findGroup(database, name));
     for (const CXGroupRef& subgroup : subgroups)
@@ -162,7 +149,7 @@ std::string valueIdentifier(const CXPerson& person, const std::string& property,
 
 void choose(Context& context, const GroupOptions& options) {
     CXRolvane& database = context.database();
-    const CXGroupRef group = changeableGroup(database, options.group);
+    const CXGroupRef group = findChangeableGroup(database, options.group);
     const CXPersonRef person = findPerson(database, options.person);
     const auto members = group->memberUniqueIds();
     if (std::find(members.begin(), members.end(), person->uniqueId()) == members.end())
@@ -198,7 +185,10 @@ void addGroupCommands(CLI::App& app, Context& context) {
     const auto people = [o](CLI::App& c) { c.add_option("people", o->names, "Names or identifiers")->required(); };
     const auto groups = [o](CLI::App& c) { c.add_option("subgroups", o->names, "Names or identifiers")->required(); };
 
-    addCommand(*group, context, "list", "List groups", nullptr, [&context] { listGroups(context); });
+    const auto whose = std::make_shared<Whose>();
+    addCommand(
+        *group, context, "list", "List groups", [whose](CLI::App& c) { declareWhose(c, *whose); },
+        [&context, whose] { listGroups(context, *whose); });
     addCommand(
         *group, context, "create", "Make a group; prints the identifier",
         [&](CLI::App& c) {

@@ -1,6 +1,7 @@
 #include "Lookup.h"
 
 #include "Context.h"
+#include "Subscriptions.h"
 
 #include <algorithm>
 #include <fmt/format.h>
@@ -47,7 +48,7 @@ UniqueId only(const std::vector<CXListing>& found, const std::string& kind, cons
     constexpr size_t kShown = 10;
     std::string list;
     for (size_t i = 0; i < std::min(found.size(), kShown); ++i)
-        list += fmt::format("\n  {}  {}", found[i].uniqueId.str(), found[i].displayName);
+        list += fmt::format("\n  {}  {}{}", found[i].uniqueId.str(), found[i].displayName, ownerMark(found[i]));
     if (found.size() > kShown) list += fmt::format("\n  and {} more", found.size() - kShown);
     throw CommandError(kNotFound, fmt::format("\"{}\" fits {} {}. Name one by its identifier:{}", named, found.size(),
                                               kind == "person" ? "people" : "groups", list));
@@ -65,6 +66,18 @@ CXGroupRef findGroup(CXRolvane& database, const std::string& named, bool whole) 
     if (auto exact = std::dynamic_pointer_cast<CXGroup>(database.recordForUniqueId(UniqueId(named)))) return exact;
     const UniqueId uid = only(matches(database.listGroups(std::nullopt), named, whole), "group", named);
     return std::dynamic_pointer_cast<CXGroup>(database.recordForUniqueId(uid));
+}
+
+void requireWritable(const CXRecord& record) {
+    if (const std::string reason = record.readOnlyReason(); !reason.empty()) throw CommandError(kRefused, reason);
+}
+
+CXGroupRef findChangeableGroup(CXRolvane& database, const std::string& named, bool whole) {
+    const CXGroupRef group = findGroup(database, named, whole);
+    if (group->isAllGroup())
+        throw CommandError(kRefused, fmt::format("\"{}\" holds everybody; its members are not chosen.", group->name()));
+    requireWritable(*group);
+    return group;
 }
 
 } // namespace rolvane::cli

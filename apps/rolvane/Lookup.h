@@ -13,4 +13,9 @@ namespace rolvane::cli {
 CXPersonRef findPerson(CXRolvane& database, const std::string& named, bool whole = false);
 CXGroupRef findGroup(CXRolvane& database, const std::string& named, bool whole = false);
 
+// Throws CommandError kRefused with the reason when the record is a copy that may be read but not changed.
+void requireWritable(const CXRecord& record);
+// A group whose members and name a person may change: not an all-contacts group, and as requireWritable.
+CXGroupRef findChangeableGroup(CXRolvane& database, const std::string& named, bool whole = false);
+
 } // namespace rolvane::cli

@@ -1,5 +1,7 @@
 #include "RecordJson.h"
 
+#include "Subscriptions.h"
+
 #include "contacts/Constants.h"
 #include "foundation/Base64.h"
 
@@ -51,12 +53,22 @@ Json identifiers(const std::vector<UniqueId>& uids) {
 
 } // namespace
 
+Json ownerJson(const RemoteLocation& location) {
+    return location.empty() ? Json() : Json(publisherOf(location));
+}
+
+std::string fromText(const CXRecord& record) {
+    return fmt::format("{}, at {} ({})", publisherOf(record.remoteLocation()), record.remoteLocation().str(),
+                       record.isWritable() ? "may be changed" : "read only");
+}
+
 Json toJson(CXPerson& person) {
     Json groups = Json::array();
     for (const CXGroupRef& group : person.parentGroups()) groups.push_back(group->name());
     return {{"identifier", person.uniqueId().str()},
             {"name", person.displayName()},
             {"location", locationOf(person)},
+            {"owner", ownerJson(person.remoteLocation())},
             {"created", toJson(person.valueForProperty(kCXCreationDateProperty))},
             {"modified", toJson(person.valueForProperty(kCXModificationDateProperty))},
             {"groups", groups},
@@ -74,6 +86,7 @@ Json toJson(CXGroup& group) {
     return {{"identifier", group.uniqueId().str()},
             {"name", group.name()},
             {"location", locationOf(group)},
+            {"owner", ownerJson(group.remoteLocation())},
             {"published", published},
             {"members", identifiers(group.memberUniqueIds())},
             {"subgroups", identifiers(group.subgroupUniqueIds())},
@@ -135,7 +148,7 @@ void addLine(std::string& text, const std::string& label, const std::string& val
 std::string personText(CXPerson& person) {
     std::string text = person.displayName() + "\n";
     addLine(text, "Identifier", person.uniqueId().str());
-    if (!person.remoteLocation().empty()) addLine(text, "From", person.remoteLocation().str());
+    if (!person.remoteLocation().empty()) addLine(text, "From", fromText(person));
     for (const auto& [property, label] : kSingles)
         if (const Value value = person.valueForProperty(property)) addLine(text, label, oneLine(value));
     for (const char* property : kMultis)

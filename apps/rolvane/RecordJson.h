@@ -15,6 +15,11 @@ nlohmann::ordered_json toJson(CXPerson& person);
 // A group whole: identifier, name, location, members, subgroups, distribution choices, what it is published at.
 nlohmann::ordered_json toJson(CXGroup& group);
 
+// The publisher's name, null for the owner's own.
+nlohmann::ordered_json ownerJson(const RemoteLocation& location);
+// Whose a subscribed record is, where it came from, and whether it may be changed, as text for people.
+std::string fromText(const CXRecord& record);
+
 // A person as lines for people.
 std::string personText(CXPerson& person);
 

@@ -1,12 +1,11 @@
 #include "Context.h"
 #include "Lookup.h"
-#include "PassWatch.h"
+#include "Passes.h"
 #include "Publication.h"
 
 #include "conduits/PublishedLayout.h"
 #include "contacts/Constants.h"
 #include "daemon/DaemonControl.h"
-#include "engine/EngineState.h"
 #include "foundation/PropertyList.h"
 #include "store/CXDAVManager.h"
 
@@ -16,83 +15,11 @@ namespace rolvane::cli {
 
 namespace {
 
-constexpr double kPassSeconds = 3600; // a first publication over a slow line takes its time
-constexpr const char* kDaemonProgram = "RolvaneManager";
-
-// The owner's base location; refuses without a usable account.
-Url ownBase() {
-    const auto account = CXDAVAccount::load(); // says what is wrong with one that cannot be used
-    try {
-        if (account) (void)account->password();
-    } catch (const CXException& error) {
-        throw CommandError(kRefused, error.reason());
-    }
-    const std::string user = CXDAVManager::vaultraUser();
-    if (user.empty())
-        throw CommandError(kFailed, "There is no account on a store yet. `rolvane account set` makes one.");
-    return CXDAVManager::ostrelBaseLocationForOstrelUser(UserName(user));
-}
-
-int64_t pendingChanges() {
-    return static_cast<int64_t>(EngineState(Preferences::shared()).getPendingChanges().size());
-}
-
-// Reports the store as it is now; sets the exit code when changes are left waiting.
-void reportResult(Context& context) {
-    const int64_t waiting = pendingChanges();
-    if (waiting == 0) return;
-    CXDAVError error;
-    const bool reachable = CXDAVManager::canReachOstrelError(error);
-    context.warn(fmt::format("{} change{} wait{}: {}", waiting, waiting == 1 ? "" : "s", waiting == 1 ? "s" : "",
-                             reachable ? "the store did not take them yet. They are tried again in the next pass."
-                                       : error.reason + " They are sent when the store can be reached again."));
-    context.exitCode = reachable ? kFailed : error.code == kCXDAVErrorAuthentication ? kRefused : kUnreachable;
-}
-
-// A daemon that ends in the middle would be waited for in vain.
-void requireDaemon(const DaemonControl& daemon) {
-    if (daemon.running()) return;
-    throw CommandError(kFailed, fmt::format("RolvaneManager ended before the pass was done. What is left is kept; "
-                                            "`rolvane sync` goes on with it. Its log is {}.",
-                                            DaemonControl::logPath()));
-}
-
-// Draws the daemon's progress until what was saved at that position of the journal and that date has been through a
-// pass: the daemon has taken the journal up to there, and a pass has ended since. (A daemon that watches a database for
-// the first time takes the journal as read and scans the database instead; a pass that was under way when the change
-// was saved ends without it.)
-void waitForPass(Context& context, PassWatch& watch, int64_t position, Date saved, double seconds) {
-    ProgressBar bar(context, "Publishing");
-    watch.onEvent = [&](const PassWatch::Event& event) {
-        if (event.kind == PassWatch::Event::Kind::progress) bar.update(event.fraction);
-    };
-    CXRolvane& database = context.database();
-    const DaemonControl daemon;
-    const auto passed = [&] {
-        const auto lastPass = Preferences::shared().get(kDaemonDomain, kCXDCXConduitLastSyncDate).date();
-        return lastPass && *lastPass > saved && database.cursorPosition(kDaemonProgram) >= position;
-    };
-    const auto done = watch.waitUntil(
-        [&] {
-            if (passed()) return true;
-            requireDaemon(daemon);
-            return false;
-        },
-        seconds);
-    watch.onEvent = nullptr;
-    if (!done)
-        throw CommandError(kUnreachable, fmt::format("The daemon had not finished after {} seconds; it goes on by "
-                                                     "itself. `rolvane watch` shows how far it is.",
-                                                     seconds));
-}
-
 struct PublishOptions {
     std::string group;
     bool noWait = false, noDaemon = false, keep = false;
     double timeout = kPassSeconds;
 };
-
-void sync(Context& context, double seconds);
 
 void publish(Context& context, const PublishOptions& options) {
     const Url base = ownBase();
@@ -121,11 +48,11 @@ void publish(Context& context, const PublishOptions& options) {
         daemon.start();
     if (options.noWait) return;
     if (!changed) return sync(context, options.timeout);
-    waitForPass(context, watch, position, saved, options.timeout);
+    waitForPass(context, watch, "Publishing", position, saved, options.timeout);
     // A pass that the restart ended in the middle may have left a lock or a record behind.
     if (pendingChanges() > 0 && context.bus().connected() && CXDAVManager::canReachOstrelError(error))
         return sync(context, options.timeout);
-    reportResult(context);
+    reportPending(context);
     if (context.exitCode == kOk) context.say("Everything is on the store.");
 }
 
@@ -211,51 +138,6 @@ void unpublish(Context& context, const PublishOptions& options) {
     context.say(done + (wholeListStays ? " by itself; it stays on the store as part of the contact list."
                         : removed      ? ", and its files are off the store."
                                        : "."));
-}
-
-// One pass, to its end: the running daemon's, or one of its own where none runs.
-void makePass(Context& context, double seconds) {
-    const DaemonControl daemon;
-    if (!daemon.running()) {
-        daemon.runOnce(seconds);
-    } else {
-        PassWatch watch(context);
-        if (!context.bus().post({"SimulateVaultraNotification", std::nullopt, {}}))
-            throw CommandError(kUnreachable, "There is no session bus, so the daemon cannot be asked. `rolvane daemon "
-                                             "restart` makes a pass without one.");
-        ProgressBar bar(context, "Synchronising");
-        int stoppedBefore = -1;
-        watch.onEvent = [&](const PassWatch::Event& event) {
-            if (event.kind == PassWatch::Event::Kind::progress) bar.update(event.fraction);
-            if (event.kind == PassWatch::Event::Kind::started && stoppedBefore < 0) stoppedBefore = watch.stopped();
-        };
-        const auto passed = [&] {
-            const bool done = stoppedBefore >= 0 && watch.stopped() > stoppedBefore;
-            if (!done) requireDaemon(daemon);
-            return done;
-        };
-        if (!watch.waitUntil(passed, seconds))
-            throw CommandError(kUnreachable, fmt::format("No pass ended within {} seconds. `rolvane daemon status` "
-                                                         "tells whether the daemon is at work.",
-                                                         seconds));
-        watch.onEvent = nullptr;
-    }
-}
-
-void sync(Context& context, double seconds) {
-    Publication publication(context.database());
-    bool subscribed = false;
-    for (const CXSubscriptionRef& s : context.database().subscriptions()) subscribed = subscribed || !s->isLocal();
-    if (!publication.anything() && !subscribed) {
-        context.say("Nothing is published and nobody is subscribed to: there is nothing to bring up to date.");
-        return;
-    }
-    makePass(context, seconds);
-    // A record that met a lock of its tree waits for the next pass, and so may a connection that a restart has cut.
-    CXDAVError error;
-    if (pendingChanges() > 0 && CXDAVManager::canReachOstrelError(error)) makePass(context, seconds);
-    reportResult(context);
-    if (context.exitCode == kOk) context.say("Everything is up to date.");
 }
 
 } // namespace

@@ -19,7 +19,8 @@ Examples:
   rolvane import friends.vcf
   rolvane store start && rolvane store user add alice
   rolvane account set --user alice --endpoint ... --ca-file ... --ask-password
-  rolvane publish && rolvane watch)";
+  rolvane publish && rolvane watch
+  rolvane subscribe bob && rolvane list --of bob)";
 
 // Where the words of the line lead: the innermost command, and the word that is no command where one is needed.
 struct Named {
@@ -78,6 +79,7 @@ int main(int argc, char** argv) {
     addGroupCommands(app, context);
     addAccountCommands(app, context);
     addSharingCommands(app, context);
+    addSubscriptionCommands(app, context);
     addDaemonCommands(app, context);
     addPreferencesCommands(app, context);
     addStoreCommands(app, context);

@@ -8,6 +8,10 @@ function __rolvane_groups
     rolvane group list 2>/dev/null | string replace -r '^\S+  ' '' | string replace -r '  \(\d+ members, \d+ groups\).*$' ''
 end
 
+function __rolvane_publishers
+    rolvane subscriptions 2>/dev/null | string replace -rf '^(\S+)  .*' '$1'
+end
+
 # The words of the line that are no options lead exactly to this command.
 function __rolvane_at
     set -l words (commandline -opc)
@@ -40,6 +44,9 @@ complete -c rolvane -n '__rolvane_at' -a group -d 'Groups: list, make, fill, ren
 complete -c rolvane -n '__rolvane_at' -a account -d 'The account on the store'
 complete -c rolvane -n '__rolvane_at' -a publish -d 'Publish the contact list, or single groups, on the store'
 complete -c rolvane -n '__rolvane_at' -a unpublish -d 'Withdraw a publication and take its files off the store'
+complete -c rolvane -n '__rolvane_at' -a subscribe -d 'Take what another user has published, and keep it in step'
+complete -c rolvane -n '__rolvane_at' -a unsubscribe -d 'End a subscription; what came by it leaves this database'
+complete -c rolvane -n '__rolvane_at' -a subscriptions -d 'List the subscriptions: whose, how much, and what you may do'
 complete -c rolvane -n '__rolvane_at' -a sync -d 'Make a pass now and wait for its end'
 complete -c rolvane -n '__rolvane_at' -a daemon -d 'Start, stop and find the daemon'
 complete -c rolvane -n '__rolvane_at' -a status -d 'Tell what is shared and how far everything is'
@@ -65,6 +72,8 @@ complete -c rolvane -n '__rolvane_in list' -s h -l help -d 'Print this help mess
 complete -c rolvane -n '__rolvane_in list' -l json -d 'Print data as one JSON document'
 complete -c rolvane -n '__rolvane_in list' -s q -l quiet -d 'No messages but errors'
 complete -c rolvane -n '__rolvane_in list' -s g -l group -x -a '(__rolvane_groups)' -d 'Only members of this group'
+complete -c rolvane -n '__rolvane_in list' -l of -x -a '(__rolvane_publishers)' -d 'Only what came from this user (or location)'
+complete -c rolvane -n '__rolvane_in list' -l own -d 'Only your own'
 complete -c rolvane -n '__rolvane_in list' -l full -d 'With --json: every property'
 complete -c rolvane -n '__rolvane_in show' -s h -l help -d 'Print this help message and exit'
 complete -c rolvane -n '__rolvane_in show' -l json -d 'Print data as one JSON document'
@@ -138,6 +147,8 @@ complete -c rolvane -n '__rolvane_at group' -s q -l quiet -d 'No messages but er
 complete -c rolvane -n '__rolvane_in group list' -s h -l help -d 'Print this help message and exit'
 complete -c rolvane -n '__rolvane_in group list' -l json -d 'Print data as one JSON document'
 complete -c rolvane -n '__rolvane_in group list' -s q -l quiet -d 'No messages but errors'
+complete -c rolvane -n '__rolvane_in group list' -l of -x -a '(__rolvane_publishers)' -d 'Only what came from this user (or location)'
+complete -c rolvane -n '__rolvane_in group list' -l own -d 'Only your own'
 complete -c rolvane -n '__rolvane_in group create' -s h -l help -d 'Print this help message and exit'
 complete -c rolvane -n '__rolvane_in group create' -l json -d 'Print data as one JSON document'
 complete -c rolvane -n '__rolvane_in group create' -s q -l quiet -d 'No messages but errors'
@@ -217,6 +228,19 @@ complete -c rolvane -n '__rolvane_in unpublish' -l json -d 'Print data as one JS
 complete -c rolvane -n '__rolvane_in unpublish' -s q -l quiet -d 'No messages but errors'
 complete -c rolvane -n '__rolvane_in unpublish' -s g -l group -x -a '(__rolvane_groups)' -d 'Withdraw this group only (name or identifier)'
 complete -c rolvane -n '__rolvane_in unpublish' -l keep -d 'Leave the files on the store'
+complete -c rolvane -n '__rolvane_in subscribe' -s h -l help -d 'Print this help message and exit'
+complete -c rolvane -n '__rolvane_in subscribe' -l json -d 'Print data as one JSON document'
+complete -c rolvane -n '__rolvane_in subscribe' -s q -l quiet -d 'No messages but errors'
+complete -c rolvane -n '__rolvane_in subscribe' -l no-wait -d 'Return as soon as the daemon is at work'
+complete -c rolvane -n '__rolvane_in subscribe' -l no-daemon -d 'Only note it; do not start the daemon'
+complete -c rolvane -n '__rolvane_in subscribe' -l timeout -x -d 'Seconds to wait for the pass'
+complete -c rolvane -n '__rolvane_in unsubscribe' -s h -l help -d 'Print this help message and exit'
+complete -c rolvane -n '__rolvane_in unsubscribe' -l json -d 'Print data as one JSON document'
+complete -c rolvane -n '__rolvane_in unsubscribe' -s q -l quiet -d 'No messages but errors'
+complete -c rolvane -n '__rolvane_in unsubscribe' -a '(__rolvane_publishers)'
+complete -c rolvane -n '__rolvane_in subscriptions' -s h -l help -d 'Print this help message and exit'
+complete -c rolvane -n '__rolvane_in subscriptions' -l json -d 'Print data as one JSON document'
+complete -c rolvane -n '__rolvane_in subscriptions' -s q -l quiet -d 'No messages but errors'
 complete -c rolvane -n '__rolvane_in sync' -s h -l help -d 'Print this help message and exit'
 complete -c rolvane -n '__rolvane_in sync' -l json -d 'Print data as one JSON document'
 complete -c rolvane -n '__rolvane_in sync' -s q -l quiet -d 'No messages but errors'

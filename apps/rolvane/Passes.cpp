@@ -1,0 +1,125 @@
+#include "Passes.h"
+
+#include "Publication.h"
+
+#include "daemon/DaemonControl.h"
+#include "engine/EngineState.h"
+#include "store/CXDAVManager.h"
+
+#include <fmt/format.h>
+
+namespace rolvane::cli {
+
+namespace {
+
+constexpr const char* kDaemonProgram = "RolvaneManager";
+
+// A daemon that ends in the middle would be waited for in vain.
+void requireDaemon(const DaemonControl& daemon) {
+    if (daemon.running()) return;
+    throw CommandError(kFailed, fmt::format("RolvaneManager ended before the pass was done. What is left is kept; "
+                                            "`rolvane sync` goes on with it. Its log is {}.",
+                                            DaemonControl::logPath()));
+}
+
+} // namespace
+
+Url ownBase() {
+    const auto account = CXDAVAccount::load(); // says what is wrong with one that cannot be used
+    try {
+        if (account) (void)account->password();
+    } catch (const CXException& error) {
+        throw CommandError(kRefused, error.reason());
+    }
+    const std::string user = CXDAVManager::vaultraUser();
+    if (user.empty())
+        throw CommandError(kFailed, "There is no account on a store yet. `rolvane account set` makes one.");
+    return CXDAVManager::ostrelBaseLocationForOstrelUser(UserName(user));
+}
+
+int64_t pendingChanges() {
+    return static_cast<int64_t>(EngineState(Preferences::shared()).getPendingChanges().size());
+}
+
+void reportPending(Context& context) {
+    const int64_t waiting = pendingChanges();
+    if (waiting == 0) return;
+    CXDAVError error;
+    const bool reachable = CXDAVManager::canReachOstrelError(error);
+    context.warn(fmt::format("{} change{} wait{}: {}", waiting, waiting == 1 ? "" : "s", waiting == 1 ? "s" : "",
+                             reachable ? "the store did not take them yet. They are tried again in the next pass."
+                                       : error.reason + " They are sent when the store can be reached again."));
+    context.exitCode = reachable ? kFailed : error.code == kCXDAVErrorAuthentication ? kRefused : kUnreachable;
+}
+
+void waitForPass(Context& context, PassWatch& watch, const std::string& label, int64_t position, Date saved,
+                 double seconds) {
+    ProgressBar bar(context, label);
+    watch.onEvent = [&](const PassWatch::Event& event) {
+        if (event.kind == PassWatch::Event::Kind::progress) bar.update(event.fraction);
+    };
+    CXRolvane& database = context.database();
+    const DaemonControl daemon;
+    const auto passed = [&] {
+        const auto lastPass = Preferences::shared().get(kDaemonDomain, kCXDCXConduitLastSyncDate).date();
+        return lastPass && *lastPass > saved && database.cursorPosition(kDaemonProgram) >= position;
+    };
+    const auto done = watch.waitUntil(
+        [&] {
+            if (passed()) return true;
+            requireDaemon(daemon);
+            return false;
+        },
+        seconds);
+    watch.onEvent = nullptr;
+    if (!done)
+        throw CommandError(kUnreachable, fmt::format("The daemon had not finished after {} seconds; it goes on by "
+                                                     "itself. `rolvane watch` shows how far it is.",
+                                                     seconds));
+}
+
+void makePass(Context& context, double seconds) {
+    const DaemonControl daemon;
+    if (!daemon.running()) {
+        daemon.runOnce(seconds);
+    } else {
+        PassWatch watch(context);
+        if (!context.bus().post({"SimulateVaultraNotification", std::nullopt, {}}))
+            throw CommandError(kUnreachable, "There is no session bus, so the daemon cannot be asked. `rolvane daemon "
+                                             "restart` makes a pass without one.");
+        ProgressBar bar(context, "Synchronising");
+        int stoppedBefore = -1;
+        watch.onEvent = [&](const PassWatch::Event& event) {
+            if (event.kind == PassWatch::Event::Kind::progress) bar.update(event.fraction);
+            if (event.kind == PassWatch::Event::Kind::started && stoppedBefore < 0) stoppedBefore = watch.stopped();
+        };
+        const auto passed = [&] {
+            const bool done = stoppedBefore >= 0 && watch.stopped() > stoppedBefore;
+            if (!done) requireDaemon(daemon);
+            return done;
+        };
+        if (!watch.waitUntil(passed, seconds))
+            throw CommandError(kUnreachable, fmt::format("No pass ended within {} seconds. `rolvane daemon status` "
+                                                         "tells whether the daemon is at work.",
+                                                         seconds));
+        watch.onEvent = nullptr;
+    }
+}
+
+void sync(Context& context, double seconds) {
+    Publication publication(context.database());
+    bool subscribed = false;
+    for (const CXSubscriptionRef& s : context.database().subscriptions()) subscribed = subscribed || !s->isLocal();
+    if (!publication.anything() && !subscribed) {
+        context.say("Nothing is published and nobody is subscribed to: there is nothing to bring up to date.");
+        return;
+    }
+    makePass(context, seconds);
+    // A record that met a lock of its tree waits for the next pass, and so may a connection that a restart has cut.
+    CXDAVError error;
+    if (pendingChanges() > 0 && CXDAVManager::canReachOstrelError(error)) makePass(context, seconds);
+    reportPending(context);
+    if (context.exitCode == kOk) context.say("Everything is up to date.");
+}
+
+} // namespace rolvane::cli

@@ -1,0 +1,245 @@
+#include "Context.h"
+#include "Passes.h"
+#include "Publication.h"
+#include "Subscriptions.h"
+
+#include "conduits/PublishedLayout.h"
+#include "daemon/DaemonControl.h"
+#include "engine/EngineState.h"
+#include "foundation/Log.h"
+#include "model/RemoteLocationMap.h"
+#include "store/CXDAVManager.h"
+
+#include <fmt/format.h>
+
+namespace rolvane::cli {
+
+namespace {
+
+using Json = nlohmann::ordered_json;
+
+constexpr const char* kSubscriptionListChanged = "CXSubscriptionListChanged";
+constexpr int kForbidden = 403;
+constexpr int kMissing = 404;
+
+struct SubscribeOptions {
+    std::string named;
+    bool noWait = false, noDaemon = false;
+    double timeout = kPassSeconds;
+};
+
+std::string counted(size_t count, const char* one, const char* several) {
+    return fmt::format("{} {}", count, count == 1 ? one : several);
+}
+
+// The location that the words name on the account's store, as the daemon will ask for it.
+RemoteLocation namedLocation(const std::string& named) {
+    const auto baseOf = [](const std::string& user) {
+        return RemoteLocation(CXDAVManager::ostrelBaseLocationForOstrelUser(UserName(user)).absoluteString());
+    };
+    if (named.empty()) throw CommandError(kUsage, "Name the user whose contacts you want.");
+    const bool isLocation = named.find(':') != std::string::npos || named.find('/') != std::string::npos;
+    if (!isLocation) return baseOf(named);
+    std::string text = named;
+    while (text.ends_with('/')) text.pop_back();
+    const RemoteLocation location(text);
+    if (syncSourceForRemoteLocation(location) != CXDSyncSourceVaultra)
+        throw CommandError(kUsage, fmt::format("\"{}\" is no location of a store. Give the user's name, or a location "
+                                               "like {}.",
+                                               named, baseOf("alice").str()));
+    const std::string user = publisherOf(location);
+    if (user.empty() || baseOf(user) != location)
+        throw CommandError(kNotFound, fmt::format("{} is not on the store of your account, where locations are like "
+                                                  "{}. Give the user's name instead.",
+                                                  named, baseOf(user.empty() ? "alice" : user).str()));
+    return location;
+}
+
+// Asks the store whether there is something that may be read, and says clearly why not.
+void requirePublication(const RemoteLocation& location) {
+    const std::string user = publisherOf(location), self = CXDAVManager::vaultraUser();
+    CXDAVError error;
+    if (!CXDAVManager::canReachOstrelError(error))
+        throw CommandError(error.code == kCXDAVErrorAuthentication ? kRefused : kUnreachable,
+                           error.reason + " Nothing was subscribed to.");
+    int code = 0;
+    const Url info = Url(location.str()).cxURLByAppendingComponent(layout::kInfo);
+    if (CXDAVManager::defaultManager().dictionaryAtURL(info, false, &code)) return;
+    if (code == kForbidden)
+        throw CommandError(kRefused, fmt::format("The store does not let you read the contacts of \"{0}\". Check the "
+                                                 "name, or ask for the right to read: `rolvane share {1}`, typed by "
+                                                 "{0}, grants it.",
+                                                 user, self));
+    if (code == kMissing)
+        throw CommandError(kNotFound, fmt::format("\"{0}\" has published nothing on this store. Check the name, or ask "
+                                                  "{0} to publish, with `rolvane publish`.",
+                                                  user));
+    throw CommandError(code == 0 ? kUnreachable : kFailed,
+                       fmt::format("What \"{}\" has published could not be read ({}). Nothing was subscribed to; try "
+                                   "again later.",
+                                   user, code == 0 ? "the store did not answer" : fmt::format("it answered {}", code)));
+}
+
+Json described(CXRolvane& database, const CXSubscriptionRef& subscription) {
+    Preferences& preferences = Preferences::shared();
+    const RemoteLocation location = subscription->remoteLocation();
+    const Value seen = preferences.get(kDaemonDomain, kCXDVaultraConduitLastSyncDate);
+    const bool known = wasRead(preferences, location);
+    return {{"user", publisherOf(location)},
+            {"location", location.str()},
+            {"people", database.countPeople(location)},
+            {"groups", database.listGroups(location).size()},
+            {"writable", subscription->isWritable()},
+            {"pending", pendingFor(preferences, location)},
+            {"lastSeen", known && seen.date() ? Json(seen.date()->toISO8601()) : Json()}};
+}
+
+std::string amount(const Json& subscription) {
+    return counted(subscription["people"], "person", "people") + " and " +
+           counted(subscription["groups"], "group", "groups");
+}
+
+// subscribe --------------------------------------------------------------------------------------------------------
+
+void startDaemonFor(Context& context, bool served) {
+    const DaemonControl daemon;
+    if (!daemon.running())
+        daemon.start();
+    else if (!served || !context.bus().post({kSubscriptionListChanged, std::nullopt, {}}))
+        daemon.restart(); // one that started with nothing shared hears nothing; without a bus nobody does
+}
+
+// Waits for the pass that brings the people, and tells what came.
+void waitForPeople(Context& context, PassWatch& watch, const RemoteLocation& location, int64_t position, Date saved,
+                   double seconds) {
+    CXRolvane& database = context.database();
+    const std::string user = publisherOf(location);
+    waitForPass(context, watch, "Fetching", position, saved, seconds);
+    // The pass may have begun before the subscription, or may have been ended in the middle by the restart.
+    CXDAVError error;
+    const auto missing = [&] {
+        return database.findSubscriptionWithRemoteLocation(location) &&
+               (!wasRead(Preferences::shared(), location) || pendingChanges() > 0);
+    };
+    for (int again = 0; again < 2 && missing() && CXDAVManager::canReachOstrelError(error); ++again)
+        makePass(context, seconds);
+    const CXSubscriptionRef subscription = database.findSubscriptionWithRemoteLocation(location);
+    if (!subscription)
+        throw CommandError(kRefused, fmt::format("The store let go of the contacts of \"{}\" while they were fetched: "
+                                                 "they are withdrawn, and the subscription has ended.",
+                                                 user));
+    if (!wasRead(Preferences::shared(), location)) {
+        const bool reachable = CXDAVManager::canReachOstrelError(error);
+        throw CommandError(reachable ? kFailed : kUnreachable,
+                           fmt::format("The contacts of \"{}\" have not come yet: {} They come with a later pass.",
+                                       user, reachable ? "the store did not give all of them." : error.reason));
+    }
+    reportPending(context);
+    const Json data = described(database, subscription);
+    if (context.json) context.print(data);
+    context.say(fmt::format("{} of \"{}\" are here; you may {}.", amount(data), user,
+                            data["writable"].get<bool>() ? "change them" : "read them but not change them"));
+}
+
+void subscribe(Context& context, const SubscribeOptions& options) {
+    (void)ownBase();
+    const RemoteLocation location = namedLocation(options.named);
+    const std::string user = publisherOf(location), self = CXDAVManager::vaultraUser();
+    if (userForRemoteLocation(location, UserName(self), {}) == kSelf)
+        throw CommandError(kRefused, fmt::format("\"{}\" is your own account; its contacts are here already. To share "
+                                                 "them with others, use `rolvane publish`.",
+                                                 user));
+    CXRolvane& database = context.database();
+    if (database.findSubscriptionWithRemoteLocation(location))
+        throw CommandError(kRefused, fmt::format("You are subscribed to \"{}\" already. `rolvane sync` brings what is "
+                                                 "new, `rolvane subscriptions` tells how it stands.",
+                                                 user));
+    requirePublication(location);
+
+    const bool served = Publication(database).anything() || !subscriptionsToPeople(database).empty();
+    PassWatch watch(context);
+    database.addRecord(CXSubscription::create(location));
+    database.save();
+    const int64_t position = database.journalPosition();
+    const Date saved = Clock::system().now();
+    context.say(fmt::format("You are subscribed to \"{}\" at {}.", user, location.str()));
+    if (!options.noDaemon) startDaemonFor(context, served);
+    if (!options.noDaemon && !options.noWait)
+        waitForPeople(context, watch, location, position, saved, options.timeout);
+    else if (context.json)
+        context.print(described(database, database.findSubscriptionWithRemoteLocation(location)));
+}
+
+// unsubscribe ------------------------------------------------------------------------------------------------------
+
+// One save takes the subscription and all that came by it away. The daemon rests meanwhile, and what it remembers of
+// the publisher goes before it starts again: nothing of this is an edit that would be carried to the publisher's store.
+void unsubscribe(Context& context, const std::string& named) {
+    CXRolvane& database = context.database();
+    const CXSubscriptionRef subscription = findSubscription(database, named);
+    const RemoteLocation location = subscription->remoteLocation();
+    const DaemonControl daemon;
+    const bool ran = daemon.stop();
+    const Json data = described(database, subscription);
+    try {
+        const UniqueId identifier = subscription->uniqueId();
+        database.removeRecord(subscription);
+        database.save();
+        forgetSubscription(Preferences::shared(), location, identifier);
+    } catch (const CXException&) {
+        if (ran) daemon.start();
+        throw;
+    }
+    context.bus().post({kSubscriptionListChanged, std::nullopt, {}});
+    if (ran) daemon.start();
+    if (context.json) context.print(data);
+    context.say(fmt::format("You are no longer subscribed to \"{}\"; {} left with it.", data["user"].get<std::string>(),
+                            amount(data)));
+    if (const size_t lost = data["pending"]; lost > 0)
+        context.warn(fmt::format("{} of yours had not been sent yet and {} dropped.",
+                                 counted(lost, "change", "changes"), lost == 1 ? "is" : "are"));
+}
+
+// subscriptions ----------------------------------------------------------------------------------------------------
+
+void listSubscriptions(Context& context) {
+    CXRolvane& database = context.database();
+    Json all = Json::array();
+    for (const CXSubscriptionRef& s : subscriptionsToPeople(database)) all.push_back(described(database, s));
+    if (context.json) return context.print(all);
+    if (all.empty()) context.say("There is none. `rolvane subscribe USER` makes one.");
+    for (const Json& s : all) {
+        context.line(fmt::format("{}  {}", s["user"].get<std::string>(), s["location"].get<std::string>()));
+        context.line(
+            fmt::format("    {}, {}, {}", amount(s), s["writable"].get<bool>() ? "read and write" : "read only",
+                        s["lastSeen"].is_null() ? "not read yet" : "last seen " + s["lastSeen"].get<std::string>()));
+        if (const size_t pending = s["pending"]; pending > 0)
+            context.line(fmt::format("    {} to be sent", counted(pending, "change waits", "changes wait")));
+    }
+}
+
+} // namespace
+
+void addSubscriptionCommands(CLI::App& app, Context& context) {
+    const auto options = std::make_shared<SubscribeOptions>();
+    addCommand(
+        app, context, "subscribe", "Take what another user has published, and keep it in step",
+        [&](CLI::App& command) {
+            command.add_option("user", options->named, "User name on the store, or a location")->required();
+            command.add_flag("--no-wait", options->noWait, "Return as soon as the daemon is at work");
+            command.add_flag("--no-daemon", options->noDaemon, "Only note it; do not start the daemon");
+            command.add_option("--timeout", options->timeout, "Seconds to wait for the pass")
+                ->check(CLI::PositiveNumber)
+                ->capture_default_str();
+        },
+        [&context, options] { subscribe(context, *options); });
+    const auto named = std::make_shared<std::string>();
+    addCommand(
+        app, context, "unsubscribe", "End a subscription; what came by it leaves this database",
+        [&](CLI::App& command) { command.add_option("user", *named, "User name or location")->required(); },
+        [&context, named] { unsubscribe(context, *named); });
+    addCommand(app, context, "subscriptions", "List the subscriptions: whose, how much, and what you may do", nullptr,
+               [&context] { listSubscriptions(context); });
+}
+
+} // namespace rolvane::cli

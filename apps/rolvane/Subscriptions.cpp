@@ -1,0 +1,99 @@
+#include "Subscriptions.h"
+
+#include "Context.h"
+#include "Publication.h"
+
+#include "engine/EngineState.h"
+#include "model/RemoteLocationMap.h"
+
+#include <algorithm>
+#include <fmt/format.h>
+
+namespace rolvane::cli {
+
+namespace {
+
+constexpr const char* kPriorState = "priorState";
+
+std::string folded(std::string text) {
+    for (char& c : text)
+        if (c >= 'A' && c <= 'Z') c = static_cast<char>(c - 'A' + 'a');
+    return text;
+}
+
+} // namespace
+
+std::string publisherOf(const RemoteLocation& location) {
+    const auto user = userForRemoteLocation(location, std::nullopt, {});
+    return user ? user->str() : std::string();
+}
+
+std::string ownerMark(const CXListing& listing) {
+    return listing.location.empty() ? "" : "  [" + publisherOf(listing.location) + "]";
+}
+
+std::vector<CXSubscriptionRef> subscriptionsToPeople(CXRolvane& database) {
+    std::vector<CXSubscriptionRef> all = database.subscriptions();
+    std::erase_if(all, [](const CXSubscriptionRef& s) {
+        return s->isLocal() || s->remoteLocation() == RemoteLocation(Publication::kGroupsLocation);
+    });
+    return all;
+}
+
+CXSubscriptionRef findSubscription(CXRolvane& database, const std::string& named) {
+    const std::vector<CXSubscriptionRef> all = subscriptionsToPeople(database);
+    std::vector<CXSubscriptionRef> found;
+    for (const CXSubscriptionRef& s : all)
+        if (s->remoteLocation().str() == named) return s;
+    for (const CXSubscriptionRef& s : all)
+        if (publisherOf(s->remoteLocation()) == named) found.push_back(s);
+    if (found.empty())
+        for (const CXSubscriptionRef& s : all)
+            if (folded(publisherOf(s->remoteLocation())) == folded(named)) found.push_back(s);
+    if (found.size() == 1) return found.front();
+    if (found.empty())
+        throw CommandError(kNotFound, fmt::format("There is no subscription to \"{}\". `rolvane subscriptions` lists "
+                                                  "what there is.",
+                                                  named));
+    std::string list;
+    for (const CXSubscriptionRef& s : found) list += "\n  " + s->remoteLocation().str();
+    throw CommandError(
+        kNotFound, fmt::format("\"{}\" fits {} subscriptions. Name one by its location:{}", named, found.size(), list));
+}
+
+void declareWhose(CLI::App& command, Whose& whose) {
+    CLI::Option* of = command.add_option("--of", whose.publisher, "Only what came from this user (or location)");
+    command.add_flag("--own", whose.own, "Only your own")->excludes(of);
+}
+
+std::optional<RemoteLocation> locationOf(CXRolvane& database, const Whose& whose) {
+    if (whose.own) return RemoteLocation("");
+    if (whose.publisher.empty()) return std::nullopt;
+    return findSubscription(database, whose.publisher)->remoteLocation();
+}
+
+bool wasRead(Preferences& preferences, const RemoteLocation& location) {
+    EngineState state(preferences);
+    return state.conduitObjectForKey(kConduitVaultra, kPriorState).contains(publisherOf(location));
+}
+
+size_t pendingFor(Preferences& preferences, const RemoteLocation& location) {
+    const UserName user(publisherOf(location));
+    const CXDChangeRecords waiting = EngineState(preferences).getPendingChanges();
+    return static_cast<size_t>(std::count_if(waiting.begin(), waiting.end(),
+                                             [&](const CXDChangeRecordPtr& record) { return record->user() == user; }));
+}
+
+void forgetSubscription(Preferences& preferences, const RemoteLocation& location, const UniqueId& subscription) {
+    const UserName user(publisherOf(location));
+    EngineState state(preferences);
+    for (const char* conduit : {kConduitCX, kConduitVaultra})
+        state.conduitObjectForKey(conduit, kPriorState).remove(user.str());
+    state.removeSubscription(subscription);
+    CXDChangeRecords waiting = state.getPendingChanges();
+    if (std::erase_if(waiting, [&](const CXDChangeRecordPtr& record) { return record->user() == user; }) > 0)
+        state.setPendingChanges(waiting);
+    state.syncPrefs();
+}
+
+} // namespace rolvane::cli
