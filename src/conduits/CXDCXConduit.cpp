@@ -3,6 +3,7 @@
 #include "conduits/ChangeCapture.h"
 #include "conduits/ContactReader.h"
 #include "conduits/GroupComparison.h"
+#include "conduits/PublishedLayout.h"
 #include "conduits/RemovalChanges.h"
 #include "contacts/CXRolvane.h"
 #include "contacts/Constants.h"
@@ -103,13 +104,23 @@ CXDChangeRecords CXDCXConduit::changeRecords() {
             if (person.writer != ownProgram()) capture.addPerson(person, true);
         });
     for (const CXSubscriptionRef& subscription : rolvane().subscriptions())
-        if (subscription->_isAll())
+        if (subscription->_isAll() && saysSomething(*subscription))
             capture.addGroup(rolvane().allGroupForRemoteLocation(subscription->remoteLocation()));
     capture.addGroup(rolvane().allGroup());
 
     _scan = scan;
     _editsKnown = scan.journalPosition;
     return capture.take();
+}
+
+// The all-contacts group of a subscription by which nothing has come yet is the framework's doing and nobody's edit.
+// Taken for a new group it would be written to the publisher's store, and wait for ever where that may not be written.
+bool CXDCXConduit::saysSomething(const CXSubscription& subscription) const {
+    const RemoteLocation location = subscription.remoteLocation();
+    if (priorState()[engine().userForRemoteLocation(location).str()].dictionary().contains(layout::kAllGroup))
+        return true;
+    const CXAllGroupRef group = rolvane().allGroupForRemoteLocation(location);
+    return group && (group->memberCount() > 0 || !group->subgroupUniqueIds().empty());
 }
 
 // -- other processes' saves

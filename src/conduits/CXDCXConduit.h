@@ -16,6 +16,7 @@ namespace rolvane {
 class CXGroup;
 class CXMultiValue;
 class CXPerson;
+class CXSubscription;
 class CXRecord;
 class CXRolvane;
 class ChangeCapture;
@@ -126,6 +127,7 @@ private:
 
     Dictionary priorState() const;
     ChangeCapture newCapture() const;
+    bool saysSomething(const CXSubscription& subscription) const;
     const std::string& ownProgram() const;
     bool dispatch(const CXDChangeRecordPtr& record);
     // What the record names, where it is there, of the right kind and the record's to change; else null.

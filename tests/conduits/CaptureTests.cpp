@@ -317,6 +317,23 @@ TEST_F(SingleGroups, AreScannedWithoutTheRestOfTheDatabase) {
     for (const auto& call : engine.takeCalls()) EXPECT_FALSE(call.starts_with("kill")) << call;
 }
 
+// -- subscriptions
+
+TEST_F(CaptureWorld, ASubscriptionByWhichNothingHasComeYetIsNoEditOfThePublishersList) {
+    const RemoteLocation bobs("http://store/bob/Contacts");
+    database.addRecord(CXSubscription::create(bobs));
+    save();
+    conduit->open();
+    for (const auto& one : lines(conduit->changeRecords())) EXPECT_EQ(one.find(" bob "), std::string::npos) << one;
+    // Once the publisher's list is known, it is compared again.
+    engine.conduitObjectForKey("CXDCX", "priorState")
+        .dictionaryFor("bob")
+        .set("AllCXGroup", Dictionary{{"memberUIDState", Array{"GONE:CXPerson"}}});
+    Texts compared = lines(conduit->changeRecords());
+    std::erase_if(compared, [](const std::string& one) { return one.find(" bob ") == std::string::npos; });
+    EXPECT_FALSE(compared.empty());
+}
+
 // -- lookup
 
 TEST_F(Capture, LooksUpANormalisedIdentifierInTheSubscribedCopyFirst) {

@@ -28,10 +28,18 @@ public:
         each(CXPerson::searchElementForProperty(kCXModificationDateProperty, "", "", lastSync, 4), people);
         each(CXSubscribedPerson::searchElementForProperty(kCXModificationDateProperty, "", "", lastSync, 4), people);
         for (const auto& subscription : _database.subscriptions())
-            if (subscription->_isAll())
+            if (subscription->_isAll() && !isNews(subscription->remoteLocation()))
                 append(all, changesForGroup(_database.allGroupForRemoteLocation(subscription->remoteLocation())));
         append(all, changesForGroup(_database.allGroup()));
         return all;
+    }
+
+    // A subscription by which nothing has come yet.
+    bool isNews(const RemoteLocation& location) {
+        const auto group = _database.allGroupForRemoteLocation(location);
+        const auto known = _engine.conduitObjectForKey("CXDCX", "priorState");
+        return group->members().empty() && group->subgroups().empty() &&
+               !known[_engine.userForRemoteLocation(location).str()].dictionary().contains("AllCXGroup");
     }
 
     CXDChangeRecords changesForPerson(const CXPersonRef& person, bool update) {
