@@ -129,7 +129,7 @@ struct PrivateStore::Implementation {
 };
 
 void PrivateStore::Implementation::makeDirectories() {
-    for (const char* name : {"", "/conf", "/tls", "/run", "/logs", "/locks"})
+    for (const char* name : {"", "/conf", "/tls", "/run", "/logs", "/locks", "/lists"})
         CXPathUtils_MakeCompletePath(state + name, 0700);
     CXPathUtils_MakeCompletePath(davDirectory(), 0700);
 }
@@ -176,13 +176,13 @@ void PrivateStore::Implementation::writeConfiguration(int port) {
     if (options.tls) certificates().ensure(options.hosts, options.certificateLifetime);
     writeFileDurably(configurationFile(),
                      renderStoreConfiguration(readFile(storeTemplatePath()), options, port, LoopbackPort::hasIPv6()));
-    writeFileDurably(state + "/conf/users.conf",
-                     renderStoreUsers(davDirectory(), passwords().users(), options.authentication));
+    writeFileDurably(state + "/conf/users.conf", renderStoreUsers(davDirectory(), passwords().users(),
+                                                                  options.authentication, options.keepsAccessLists()));
     writeFileDurably(settingsFile(), PropertyList::toXML(storeOptionsToDictionary(options, port)));
 }
 
 void PrivateStore::Implementation::handOver(const StoreIdentity& identity) const {
-    for (const char* name : {"/conf", "/tls", "/run", "/logs", "/locks"}) identity.ownAllIn(state + name);
+    for (const char* name : {"/conf", "/tls", "/run", "/logs", "/locks", "/lists"}) identity.ownAllIn(state + name);
     for (const auto& user : passwords().users()) {
         CXPathUtils_MakeCompletePath(davDirectory() + "/" + user, 0700);
         identity.own(davDirectory() + "/" + user);

@@ -21,6 +21,7 @@ struct PrivateStoreOptions {
     bool tls = true;
     StoreAuthentication authentication = StoreAuthentication::basic;
     bool http2 = true;
+    bool accessLists = true; // owners say who may read and write their trees; needs authentication
     std::vector<std::string> hosts = {"localhost", "127.0.0.1", "::1"}; // names and addresses in the certificate
 
     int processes = 1; // at start; grows up to maximumProcesses
@@ -36,6 +37,8 @@ struct PrivateStoreOptions {
     std::chrono::seconds certificateLifetime{std::chrono::hours(24 * 365 * 5)};
     std::string httpdProgram = "/usr/sbin/apache2";
     std::string httpdModules = "/usr/lib/apache2/modules";
+
+    bool keepsAccessLists() const { return accessLists && authentication != StoreAuthentication::none; }
 };
 
 struct PrivateStoreStatus {
@@ -45,8 +48,9 @@ struct PrivateStoreStatus {
 };
 
 // A private WebDAV store: an unprivileged httpd on the loopback addresses with its own certificate authority, users and
-// lock database below one state directory. It serves <documentRoot>/dav as /dav; every user has the tree /dav/<user>
-// alone: nobody else reads or writes there, and nothing outside these trees is served.
+// lock database below one state directory. It serves <documentRoot>/dav as /dav; every user has the tree /dav/<user>,
+// and nothing outside these trees is served. Nobody else reads or writes there but whom the owner's access lists let in
+// (docs/mod_davacl.md; the groups are those of <stateDirectory>/conf/groups). The principals are below /principals.
 //
 // Started by root, httpd runs as www-data (else nobody); where that user cannot reach the state directory or document
 // root, it keeps the right to search and read past file modes, and no other.

@@ -38,6 +38,7 @@ std::string switches(const PrivateStoreOptions& options) {
     if (options.accessLog) text += "Define ACCESSLOG\n";
     if (options.authentication == StoreAuthentication::basic) text += "Define BASIC\n";
     if (options.authentication == StoreAuthentication::digest) text += "Define DIGEST\n";
+    if (options.keepsAccessLists()) text += "Define ACCESSLISTS\n";
     return text;
 }
 
@@ -88,11 +89,28 @@ std::string storeTemplatePath() {
                                                     std::string(ROLVANE_INSTALLED_SHARE) + ". Install rolvane again.");
 }
 
+std::string storeAccessModulePath(const std::string& httpdModules) {
+    // What was built or installed together with the program comes before what the system may have from another version.
+    const std::string candidates[] = {programDirectory() + "/../lib/apache2/modules/mod_davacl.so",
+                                      ROLVANE_BUILT_DAVACL,
+
+                                      ROLVANE_INSTALLED_MODULES "/mod_davacl.so", httpdModules + "/mod_davacl.so"};
+    for (const auto& path : candidates)
+        if (access(path.c_str(), R_OK) == 0) return path;
+    return {};
+}
+
 std::string renderStoreConfiguration(const std::string& templateText, const PrivateStoreOptions& options, int port,
                                      bool withIPv6) {
     for (const auto& path : {options.stateDirectory, options.documentRoot, options.httpdModules})
         refuseUnsafePath(path);
     refuseUnsafeWord("log level", options.logLevel);
+    const std::string module = options.keepsAccessLists() ? storeAccessModulePath(options.httpdModules) : "/none";
+    if (module.empty())
+        throw CXException(kCXPrivateStoreException,
+                          "The store's access lists need mod_davacl.so, which is missing from " +
+                              std::string(ROLVANE_INSTALLED_MODULES) + ". Install rolvane again.");
+    refuseUnsafePath(module);
     const std::string number = std::to_string(port);
     const int threads = std::clamp(options.threadsPerProcess, 1, 1000);
     const int processes = std::clamp(options.processes, 1, 100);
@@ -102,6 +120,7 @@ std::string renderStoreConfiguration(const std::string& templateText, const Priv
                       {{"STATE", options.stateDirectory},
                        {"ROOT", options.documentRoot},
                        {"MODULES", options.httpdModules},
+                       {"DAVACL", module},
                        {"REALM", kStoreRealm},
                        {"LISTEN", "Listen 127.0.0.1:" + number + (withIPv6 ? "\nListen [::1]:" + number : "")},
                        {"PROCESSES", std::to_string(processes)},
@@ -115,11 +134,14 @@ std::string renderStoreConfiguration(const std::string& templateText, const Priv
 }
 
 std::string renderStoreUsers(const std::string& davDirectory, const std::vector<std::string>& users,
-                             StoreAuthentication authentication) {
+                             StoreAuthentication authentication, bool accessLists) {
     std::string text;
     for (const auto& user : users) {
         text += "<Directory \"" + davDirectory + "/" + user + "\">\n  ";
-        text += authentication == StoreAuthentication::none ? "Require all granted" : "Require user " + user;
+        if (authentication == StoreAuthentication::none)
+            text += "Require all granted";
+        else
+            text += accessLists ? "Require valid-user" : "Require user " + user;
         text += "\n</Directory>\n";
     }
     return text;
@@ -132,6 +154,7 @@ Dictionary storeOptionsToDictionary(const PrivateStoreOptions& options, int port
     d.set("tls", options.tls);
     d.set("authentication", kAuthenticationNames[static_cast<int>(options.authentication)]);
     d.set("http2", options.http2);
+    d.set("accessLists", options.accessLists);
     d.set("hosts", toArray(options.hosts));
     d.set("processes", options.processes);
     d.set("maximumProcesses", options.maximumProcesses);
@@ -152,6 +175,7 @@ PrivateStoreOptions storeOptionsFromDictionary(const Dictionary& d) {
     for (int i = 0; i < 3; ++i)
         if (d["authentication"].string() == kAuthenticationNames[i]) options.authentication = StoreAuthentication(i);
     options.http2 = d["http2"].boolean(options.http2);
+    options.accessLists = d["accessLists"].boolean(options.accessLists);
     if (d.contains("hosts")) options.hosts = toStrings(d["hosts"].array());
     readInteger("port", options.port);
     readInteger("processes", options.processes);

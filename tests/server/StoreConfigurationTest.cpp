@@ -38,7 +38,8 @@ TEST(StoreConfiguration, PutsValuesInOnceAndDoesNotReadThemAgain) {
     PrivateStoreOptions o = options();
     o.extraConfiguration = {"# @STATE@ me@example.org"};
     EXPECT_EQ(renderStoreConfiguration("a@b @LISTEN@\n@EXTRA@", o, 1, false),
-              "Define TLS\nDefine HTTP2\nDefine BASIC\na@b Listen 127.0.0.1:1\n# @STATE@ me@example.org\n");
+              "Define TLS\nDefine HTTP2\nDefine BASIC\nDefine ACCESSLISTS\na@b Listen 127.0.0.1:1\n# @STATE@ "
+              "me@example.org\n");
 }
 
 TEST(StoreConfiguration, RefusesWhatWouldEscapeFromItsQuotationMarks) {
@@ -53,7 +54,7 @@ TEST(StoreConfiguration, RefusesWhatWouldEscapeFromItsQuotationMarks) {
 }
 
 TEST(StoreConfiguration, OpensEachTreeToItsUserByASectionOfItsOwn) {
-    EXPECT_EQ(renderStoreUsers("/root/dav", {"alice", "bob"}, StoreAuthentication::basic),
+    EXPECT_EQ(renderStoreUsers("/root/dav", {"alice", "bob"}, StoreAuthentication::basic, false),
               "<Directory \"/root/dav/alice\">\n  Require user alice\n</Directory>\n"
               "<Directory \"/root/dav/bob\">\n  Require user bob\n</Directory>\n");
 }

@@ -1,0 +1,120 @@
+#include "server/mod_davacl/Access.h"
+
+#include "server/mod_davacl/GroupFile.h"
+
+#include <fstream>
+#include <iterator>
+
+namespace rolvane::davacl {
+namespace {
+
+request_rec* mainOf(request_rec* r) {
+    while (r->main) r = r->main;
+    return r;
+}
+
+apr_status_t destroyState(void* state) {
+    delete static_cast<RequestState*>(state);
+    return APR_SUCCESS;
+}
+
+const Caller& callerOf(request_rec* r, const Configuration& c, bool groupsMatter) {
+    RequestState& state = stateOf(r);
+    if (!state.caller || state.caller->name != r->user) state.caller = Caller{r->user, {}};
+    if (groupsMatter && c.groupFile && state.caller->groups.empty())
+        state.caller->groups = groupsOf(r->user, fileText(c.groupFile));
+    return *state.caller;
+}
+
+bool isGranted(request_rec* r, const Configuration& c, const TreePath& place, const Need& need) {
+    const TreePath target = need.onParent ? place.parent() : place;
+    // Of the base's members everybody may make and remove the own tree, and nothing else.
+    if (need.onParent && target.isBase()) return r->user && !place.isBase() && place.owner == r->user;
+    return privilegesOn(r, c, target) & need.privilege;
+}
+
+} // namespace
+
+std::string fileText(const char* path) {
+    std::ifstream file(path, std::ios::binary);
+    return std::string(std::istreambuf_iterator<char>(file), {});
+}
+
+RequestState& stateOf(request_rec* r) {
+    request_rec* top = mainOf(r);
+    auto* state = static_cast<RequestState*>(ap_get_module_config(top->request_config, &davacl_module));
+    if (!state) {
+        state = new RequestState;
+        apr_pool_cleanup_register(top->pool, state, destroyState, apr_pool_cleanup_null);
+        ap_set_module_config(top->request_config, &davacl_module, state);
+    }
+    return *state;
+}
+
+const OwnersLists* listsOf(request_rec* r, const Configuration& c, const std::string& owner) {
+    auto& known = stateOf(r).lists;
+    auto found = known.find(owner);
+    if (found == known.end()) {
+        found = known.emplace(owner, ListStore(c.lists).read(owner)).first;
+        if (!found->second)
+            ap_log_rerror(APLOG_MARK, APLOG_ERR, 0, r,
+                          "davacl: the access lists of %s cannot be read or are damaged (%s): only the owner gets in",
+                          owner.c_str(), ListStore(c.lists).pathFor(owner).c_str());
+    }
+    return found->second ? &*found->second : nullptr;
+}
+
+unsigned privilegesOn(request_rec* r, const Configuration& c, const TreePath& place) {
+    if (!r->user || !*r->user) return 0;
+    if (place.isBase()) return kReading; // its members are shown by their own lists
+    if (place.owner == r->user) return kEverything;
+    const OwnersLists* lists = listsOf(r, c, place.owner);
+    if (!lists || lists->empty()) return 0;
+    return lists->granted(callerOf(r, c, lists->mentionsGroups()), place.below);
+}
+
+std::optional<Missing> missingOf(request_rec* r, const Configuration& c, const TreePath& place,
+                                 const std::vector<Need>& needs) {
+    for (const Need& need : needs)
+        if (!isGranted(r, c, place, need)) return Missing{need.onParent ? place.parent() : place, need.privilege};
+    return std::nullopt;
+}
+
+Standing standingOf(const request_rec* r) {
+    if (r->finfo.filetype == APR_NOFILE || (r->path_info && *r->path_info)) return Standing::nothing;
+    return r->finfo.filetype == APR_DIR ? Standing::collection : Standing::file;
+}
+
+std::string hrefElement(request_rec* r, const std::string& path) {
+    const char* escaped = ap_os_escape_path(r->pool, path.c_str(), 1);
+    return std::string("<D:href>") + apr_xml_quote_string(r->pool, escaped, 0) + "</D:href>";
+}
+
+std::string hrefOf(request_rec* r, const Configuration& c, const TreePath& place) {
+    std::string path = c.base;
+    if (!place.isBase()) path += "/" + place.owner;
+    if (!place.below.empty()) path += "/" + place.tree();
+    if (place.levels() <= c.levels()) path += "/";
+    return hrefElement(r, path);
+}
+
+int refuse(request_rec* r, const Configuration& c, const Missing& missing) {
+    if (!r->user && ap_auth_type(r)) {
+        ap_note_auth_failure(r);
+        return HTTP_UNAUTHORIZED;
+    }
+    const std::string children = "<D:resource>" + hrefOf(r, c, missing.place) +
+                                 "<D:privilege><D:" + privilegeName(missing.privilege) +
+                                 "/></D:privilege></D:resource>";
+    const char* what = apr_psprintf(r->pool, "%s may not %s: the privilege %s is missing.",
+                                    r->user ? r->user : "Nobody", r->method, privilegeName(missing.privilege));
+    dav_error* error = dav_new_error_tag(r->pool, HTTP_FORBIDDEN, 0, 0, apr_xml_quote_string(r->pool, what, 0),
+                                         "DAV:", "need-privileges");
+    error->childtags = apr_pstrdup(r->pool, children.c_str());
+    ap_log_rerror(APLOG_MARK, APLOG_INFO, 0, r, "davacl: %s (%s)", what, r->uri);
+    r->status = HTTP_FORBIDDEN;
+    ap_discard_request_body(r);
+    return dav_handle_err(r, error, nullptr);
+}
+
+} // namespace rolvane::davacl

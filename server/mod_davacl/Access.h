@@ -1,0 +1,49 @@
+#pragma once
+
+#include "server/mod_davacl/Configuration.h"
+#include "server/mod_davacl/ListStore.h"
+#include "server/mod_davacl/Needs.h"
+#include "server/mod_davacl/TreePath.h"
+
+#include <map>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace rolvane::davacl {
+
+// A privilege that somebody lacks, and where.
+struct Missing {
+    TreePath place;
+    Privilege privilege = kRead;
+};
+
+// What one request has learnt, kept until it ends: every list is read once, however many members a listing has. It
+// belongs to the main request, which its sub-requests share.
+struct RequestState {
+    std::map<std::string, std::optional<OwnersLists>> lists; // by owner; nothing: damaged
+    std::optional<Caller> caller;
+    std::optional<Missing> destinationLacks; // why the sub-request for a Destination was refused
+    std::vector<ListStore::Guard> guards;
+};
+RequestState& stateOf(request_rec* r);
+
+const OwnersLists* listsOf(request_rec* r, const Configuration& c, const std::string& owner); // null: damaged
+// What the request's user may do there. Nobody may do anything without a name.
+unsigned privilegesOn(request_rec* r, const Configuration& c, const TreePath& place);
+// The first of the needs that is not met.
+std::optional<Missing> missingOf(request_rec* r, const Configuration& c, const TreePath& place,
+                                 const std::vector<Need>& needs);
+Standing standingOf(const request_rec* r);
+
+// The path of a place as a URL has it, escaped for XML.
+std::string hrefOf(request_rec* r, const Configuration& c, const TreePath& place);
+std::string hrefElement(request_rec* r, const std::string& path); // <D:href>, from a path that is not escaped
+
+// Answers 403 with DAV:need-privileges (RFC 3744 section 7.1.1), or asks whoever is not signed in to do so. What a
+// handler returns then.
+int refuse(request_rec* r, const Configuration& c, const Missing& missing);
+// The text of a file; "" when it cannot be read.
+std::string fileText(const char* path);
+
+} // namespace rolvane::davacl

@@ -1,0 +1,69 @@
+#pragma once
+
+#include <map>
+#include <optional>
+#include <set>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace rolvane::davacl {
+
+struct Principal {
+    enum class Kind { user, group, authenticated };
+    Kind kind = Kind::user;
+    std::string name; // "" for authenticated
+    auto operator<=>(const Principal&) const = default;
+};
+
+struct Grant {
+    Principal principal;
+    bool read = false, write = false;
+    bool operator==(const Grant&) const = default;
+};
+
+// A principal occurs once; the order is that in which they were named.
+using AccessList = std::vector<Grant>;
+void addGrant(AccessList& list, const Grant& grant); // joins what is granted to one principal
+
+// Who asks. Nobody is authenticated under an empty name.
+struct Caller {
+    std::string name;
+    std::set<std::string> groups;
+};
+
+// All the lists of one owner: one for each collection that has one, by its path below the owner's ("" for the owner's
+// root). A plain value. As a text:
+//   file  = "davacl 1" LF *( entry LF ) "end" LF
+//   entry = "/" path SP ( "r" / "w" / "rw" ) SP ( ( "user" / "group" ) SP name / "authenticated" )
+// path and name have everything but letters, digits and "-._~@+" (and the slashes of a path) percent-encoded.
+class OwnersLists {
+public:
+    // Nothing when the text is not of this form to the last byte: a list that is not understood grants nothing.
+    static std::optional<OwnersLists> parse(std::string_view text);
+    std::string text() const;
+
+    const AccessList& at(const std::string& tree) const; // empty when there is none
+    void set(const std::string& tree, AccessList list);
+    // The lists of the tree and of everything below go. False when there was none.
+    bool drop(const std::string& tree);
+    // The lists of the tree and below belong to another path from now on; what was there goes.
+    void move(const std::string& from, const std::string& to);
+    bool has(const std::string& tree) const; // the tree or anything below has one
+    bool empty() const { return _lists.empty(); }
+    bool mentionsGroups() const;
+
+    // What the lists of the places on the way down to the tree grant, together.
+    unsigned granted(const Caller& caller, const std::vector<std::string>& segments) const;
+
+    bool operator==(const OwnersLists&) const = default;
+
+private:
+    std::map<std::string, AccessList> _lists; // none of them empty
+};
+
+// Everything but letters, digits and "-._~@+" (and the slash, if asked) as %XX. The reverse takes nothing else.
+std::string percentEncoded(std::string_view text, bool keepSlashes);
+std::optional<std::string> percentDecoded(std::string_view text);
+
+} // namespace rolvane::davacl

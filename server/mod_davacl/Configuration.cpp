@@ -1,0 +1,155 @@
+#include "server/mod_davacl/Configuration.h"
+
+#include <cstring>
+#include <sys/stat.h>
+#include <unistd.h>
+
+namespace rolvane::davacl {
+namespace {
+
+Configuration* ofServer(const server_rec* server) {
+    return static_cast<Configuration*>(ap_get_module_config(server->module_config, &davacl_module));
+}
+
+// A URL path as a directive may name it, without the slash at its end; null when it is none.
+const char* urlPath(cmd_parms* cmd, const char* given) {
+    if (given[0] != '/') return nullptr;
+    char* path = apr_pstrdup(cmd->pool, given);
+    const size_t length = std::strlen(path);
+    if (length > 1 && path[length - 1] == '/') path[length - 1] = '\0';
+    char* clean = apr_pstrdup(cmd->pool, path);
+    ap_no2slash(clean);
+    ap_getparents(clean);
+    const bool usable = std::strcmp(clean, path) == 0 && path[1] != '\0' && !std::strpbrk(path, "?#%");
+    return usable ? path : nullptr;
+}
+
+const char* checkDirectory(cmd_parms* cmd, const char* path) {
+    struct stat info {};
+    if (stat(path, &info) != 0 || !S_ISDIR(info.st_mode))
+        return apr_pstrcat(cmd->pool, "the directory of the access lists, ", path,
+                           ", is not there: make it, with mode 0700 and the user that httpd runs as for its owner",
+                           nullptr);
+    if (info.st_mode & (S_IWGRP | S_IWOTH))
+        return apr_pstrcat(cmd->pool, "the directory of the access lists, ", path,
+                           ", may be written by others: give it mode 0700", nullptr);
+    return nullptr;
+}
+
+const char* setBase(cmd_parms* cmd, void*, const char* base, const char* lists) {
+    Configuration* c = ofServer(cmd->server);
+    if (c->base) return "DavAclBase may stand once in a virtual host";
+    c->base = urlPath(cmd, base);
+    if (!c->base) return "the base must be a URL path below the root, such as /dav, without escapes, \"..\" or \"//\"";
+    c->lists = ap_server_root_relative(cmd->pool, lists);
+    if (!c->lists) return "the second argument must be the directory of the access lists";
+    return checkDirectory(cmd, c->lists);
+}
+
+const char* setPrincipals(cmd_parms* cmd, void*, const char* path) {
+    Configuration* c = ofServer(cmd->server);
+    c->principals = urlPath(cmd, path);
+    return c->principals ? nullptr
+                         : "the place of the principals must be a URL path below the root, such as /principals";
+}
+
+const char* setGroupFile(cmd_parms* cmd, void*, const char* path) {
+    Configuration* c = ofServer(cmd->server);
+    c->groupFile = ap_server_root_relative(cmd->pool, path);
+    return c->groupFile ? nullptr : "the argument must be the path of a group file";
+}
+
+const char* addUsers(cmd_parms* cmd, void*, const char* provider) {
+    Configuration* c = ofServer(cmd->server);
+    if (!ap_lookup_provider(AUTHN_PROVIDER_GROUP, provider, AUTHN_PROVIDER_VERSION))
+        return apr_pstrcat(cmd->pool, "there is no authentication provider called ", provider,
+                           ": load its module before this line", nullptr);
+    if (!c->users) c->users = apr_array_make(cmd->pool, 2, sizeof(const char*));
+    *static_cast<const char**>(apr_array_push(c->users)) = apr_pstrdup(cmd->pool, provider);
+    return nullptr;
+}
+
+const char* setDepth(cmd_parms* cmd, void*, const char* text) {
+    Configuration* c = ofServer(cmd->server);
+    char* end = nullptr;
+    const apr_int64_t depth = apr_strtoi64(text, &end, 10);
+    if (*end || depth < 1 || depth > 8) return "the depth must be a number from 1 to 8";
+    c->depth = static_cast<int>(depth);
+    return nullptr;
+}
+
+// AP_INIT_* want the one type of function in a union that C++ will not convert to.
+template <class Function>
+cmd_func asCommand(Function function) {
+    return reinterpret_cast<cmd_func>(reinterpret_cast<void (*)()>(function));
+}
+
+bool isWithin(const char* path, const char* directory) {
+    const size_t length = std::strlen(directory);
+    return std::strncmp(path, directory, length) == 0 && (path[length] == '/' || path[length] == '\0');
+}
+
+const char* complaintAbout(const server_rec* server) {
+    const Configuration* c = ofServer(server);
+    if (!c->base) {
+        if (c->principals || c->groupFile || c->users || c->depth)
+            return "DavAclPrincipals, DavAclGroupFile, DavAclUsers and DavAclDepth need a DavAclBase";
+        return nullptr;
+    }
+    if (isWithin(c->base, c->principalBase()) || isWithin(c->principalBase(), c->base))
+        return "the places of the trees and of the principals must not lie within each other: set DavAclPrincipals";
+    const auto* core = static_cast<const core_server_config*>(ap_get_core_module_config(server->module_config));
+    if (core->ap_document_root &&
+        (isWithin(c->lists, core->ap_document_root) || isWithin(core->ap_document_root, c->lists)))
+        return "the directory of the access lists and the DocumentRoot must not lie within each other";
+    return nullptr;
+}
+
+} // namespace
+
+const Configuration* configurationOf(const request_rec* r) {
+    const Configuration* c = ofServer(r->server);
+    return c && c->base ? c : nullptr;
+}
+
+void* createConfiguration(apr_pool_t* pool, server_rec*) {
+    return new (apr_palloc(pool, sizeof(Configuration))) Configuration;
+}
+
+void* mergeConfigurations(apr_pool_t* pool, void* base, void* more) {
+    const auto* outer = static_cast<const Configuration*>(base);
+    const auto* inner = static_cast<const Configuration*>(more);
+    auto* merged = new (apr_palloc(pool, sizeof(Configuration))) Configuration(*outer);
+    if (inner->base) {
+        merged->base = inner->base;
+        merged->lists = inner->lists;
+    }
+    if (inner->principals) merged->principals = inner->principals;
+    if (inner->groupFile) merged->groupFile = inner->groupFile;
+    if (inner->users) merged->users = inner->users;
+    if (inner->depth) merged->depth = inner->depth;
+    return merged;
+}
+
+int checkConfigurations(apr_pool_t*, apr_pool_t*, apr_pool_t*, server_rec* server) {
+    for (; server; server = server->next)
+        if (const char* complaint = complaintAbout(server)) {
+            ap_log_error(APLOG_MARK, APLOG_STARTUP | APLOG_ERR, 0, server, "davacl: %s", complaint);
+            return HTTP_INTERNAL_SERVER_ERROR;
+        }
+    return OK;
+}
+
+const command_rec kDirectives[] = {
+    {"DavAclBase", asCommand(setBase), nullptr, RSRC_CONF, TAKE2,
+     "the URL path whose first segments name the trees' owners, and the directory of their lists"},
+    {"DavAclPrincipals", asCommand(setPrincipals), nullptr, RSRC_CONF, TAKE1,
+     "the URL path of the principals, /principals by default"},
+    {"DavAclGroupFile", asCommand(setGroupFile), nullptr, RSRC_CONF, TAKE1, "a group file, as for AuthGroupFile"},
+    {"DavAclUsers", asCommand(addUsers), nullptr, RSRC_CONF, ITERATE,
+     "authentication providers that know which users exist"},
+    {"DavAclDepth", asCommand(setDepth), nullptr, RSRC_CONF, TAKE1,
+     "how many segments below the base may have lists of their own: 2 by default"},
+    {nullptr, {nullptr}, nullptr, 0, RAW_ARGS, nullptr}};
+
+} // namespace rolvane::davacl

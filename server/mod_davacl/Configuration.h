@@ -1,0 +1,29 @@
+#pragma once
+
+#include "server/mod_davacl/Httpd.h"
+
+namespace rolvane::davacl {
+
+// What the directives of one virtual host say; in the configuration's pool. See docs/mod_davacl.md.
+struct Configuration {
+    const char* base = nullptr;          // without a slash at the end; null: the module does nothing here
+    const char* lists = nullptr;         // the directory of the lists
+    const char* principals = nullptr;    // without a slash at the end
+    const char* groupFile = nullptr;     // null: no groups
+    apr_array_header_t* users = nullptr; // of const char*: the authentication providers that know who exists
+    int depth = 0;                       // how many segments below the base may have lists of their own
+
+    const char* principalBase() const { return principals ? principals : "/principals"; }
+    size_t levels() const { return depth ? static_cast<size_t>(depth) : 2; }
+};
+
+// Null where no tree is under access lists.
+const Configuration* configurationOf(const request_rec* r);
+
+void* createConfiguration(apr_pool_t* pool, server_rec* server);
+void* mergeConfigurations(apr_pool_t* pool, void* base, void* more);
+extern const command_rec kDirectives[];
+// What can only be checked when everything has been read. OK, or DONE's opposite with a line in the log.
+int checkConfigurations(apr_pool_t* pool, apr_pool_t* log, apr_pool_t* temporary, server_rec* server);
+
+} // namespace rolvane::davacl

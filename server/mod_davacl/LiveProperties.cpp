@@ -1,0 +1,173 @@
+#include "server/mod_davacl/LiveProperties.h"
+
+#include "server/mod_davacl/Access.h"
+#include "server/mod_davacl/PrincipalResources.h"
+
+namespace rolvane::davacl {
+namespace {
+
+enum Property {
+    kOwner = 0x3744,
+    kSupportedPrivilegeSet,
+    kCurrentUserPrivilegeSet,
+    kAcl,
+    kAclRestrictions,
+    kInheritedAclSet,
+    kPrincipalCollectionSet,
+    kCurrentUserPrincipal
+};
+const char* const kNamespaces[] = {"DAV:", nullptr};
+const dav_liveprop_spec kProperties[] = {{0, "owner", kOwner, 0},
+                                         {0, "supported-privilege-set", kSupportedPrivilegeSet, 0},
+                                         {0, "current-user-privilege-set", kCurrentUserPrivilegeSet, 0},
+                                         {0, "acl", kAcl, 0},
+                                         {0, "acl-restrictions", kAclRestrictions, 0},
+                                         {0, "inherited-acl-set", kInheritedAclSet, 0},
+                                         {0, "principal-collection-set", kPrincipalCollectionSet, 0},
+                                         {0, "current-user-principal", kCurrentUserPrincipal, 0},
+                                         {0, nullptr, 0, 0}};
+
+request_rec* requestOf(const dav_resource* resource) {
+    return resource->hooks->get_request_rec ? resource->hooks->get_request_rec(resource) : nullptr;
+}
+
+struct Asked {
+    request_rec* r;
+    const Configuration& c;
+    TreePath place;
+};
+
+std::string entryOf(const std::string& principal, const std::string& privileges, bool isProtected,
+                    const std::string& inheritedFrom) {
+    return "<D:ace><D:principal>" + principal + "</D:principal><D:grant>" + privileges + "</D:grant>" +
+           (isProtected ? "<D:protected/>" : "") +
+           (inheritedFrom.empty() ? "" : "<D:inherited>" + inheritedFrom + "</D:inherited>") + "</D:ace>\n";
+}
+
+std::string entriesOf(const Asked& a, const std::string& tree, const std::string& inheritedFrom) {
+    std::string text;
+    const OwnersLists* lists = listsOf(a.r, a.c, a.place.owner);
+    if (!lists) return text;
+    for (const Grant& grant : lists->at(tree))
+        text += entryOf(principalElement(a.r, a.c, grant.principal),
+                        std::string(grant.read ? "<D:privilege><D:read/></D:privilege>" : "") +
+                            (grant.write ? "<D:privilege><D:write/></D:privilege>" : ""),
+                        false, inheritedFrom);
+    return text;
+}
+
+// The places above that have or may have a list, the nearest first.
+std::vector<TreePath> ancestorsOf(const Asked& a) {
+    std::vector<TreePath> above;
+    for (TreePath up = a.place.parent(); !up.isBase(); up = up.parent())
+        if (up.levels() <= a.c.levels()) above.push_back(up);
+    return above;
+}
+
+std::string wholeList(const Asked& a) {
+    const auto above = ancestorsOf(a);
+    const auto from = [&](const TreePath& place) { return hrefOf(a.r, a.c, place); };
+    std::string text = entryOf("<D:property><D:owner/></D:property>", "<D:privilege><D:all/></D:privilege>", true,
+                               above.empty() ? std::string() : from(above.back()));
+    if (a.place.levels() <= a.c.levels()) text += entriesOf(a, a.place.tree(), {});
+    for (const TreePath& place : above) text += entriesOf(a, place.tree(), from(place));
+    return text;
+}
+
+// Nothing: not defined there, or not for this user.
+std::optional<std::string> valueOf(const Asked& a, int property) {
+    const unsigned mine = privilegesOn(a.r, a.c, a.place);
+    switch (property) {
+    case kOwner:
+        if (a.place.isBase()) return std::string();
+        return hrefElement(a.r, userPath(a.c, a.place.owner));
+    case kSupportedPrivilegeSet: return supportedPrivileges();
+    case kCurrentUserPrivilegeSet:
+        if (!(mine & kReadCurrentUserPrivilegeSet)) return std::nullopt;
+        return privilegeElements(mine);
+    case kAcl:
+        if (a.place.isBase() || !(mine & kReadAcl)) return std::nullopt;
+        return wholeList(a);
+    case kAclRestrictions: return "<D:grant-only/><D:no-invert/>";
+    case kInheritedAclSet: {
+        std::string text;
+        if (!a.place.isBase())
+            for (const TreePath& place : ancestorsOf(a)) text += hrefOf(a.r, a.c, place);
+        return text;
+    }
+    case kPrincipalCollectionSet: return principalCollections(a.r, a.c);
+    case kCurrentUserPrincipal: return currentUserPrincipal(a.r, a.c);
+    default: return std::nullopt;
+    }
+}
+
+dav_prop_insert insertProperty(const dav_resource* resource, int property, dav_prop_insert what,
+                               apr_text_header* text) noexcept {
+    request_rec* r = requestOf(resource);
+    if (!r) return DAV_PROP_INSERT_NOTDEF;
+    return contained(r, DAV_PROP_INSERT_NOTDEF, [&] {
+        const Configuration* c = configurationOf(r);
+        const auto place = c && resource->uri ? TreePath::of(c->base, resource->uri) : std::nullopt;
+        if (!place) return DAV_PROP_INSERT_NOTDEF;
+        const dav_liveprop_spec* spec = nullptr;
+        dav_get_liveprop_info(property, &kLiveProperties, &spec);
+        const std::string name = spec->name;
+        std::string out = "<D:" + name + "/>\n";
+        if (what == DAV_PROP_INSERT_SUPPORTED)
+            out = "<D:supported-live-property D:name=\"" + name + "\" D:namespace=\"DAV:\"/>\n";
+        if (what == DAV_PROP_INSERT_VALUE) {
+            const auto value = valueOf({r, *c, *place}, property);
+            if (!value) return DAV_PROP_INSERT_NOTDEF;
+            out = "<D:" + name + ">" + *value + "</D:" + name + ">\n";
+        }
+        apr_text_append(resource->pool, text, apr_pstrdup(resource->pool, out.c_str()));
+        return what;
+    });
+}
+
+int isWritable(const dav_resource*, int) noexcept {
+    return 0;
+}
+
+dav_error* refusePatch(const dav_resource* resource, const apr_xml_elem*, int, void**, int*) noexcept {
+    return dav_new_error_tag(resource->pool, HTTP_FORBIDDEN, 0, 0, "The property is set by the ACL method only.",
+                             "DAV:", "cannot-modify-protected-property");
+}
+
+const dav_hooks_liveprop kHooks = {insertProperty, isWritable, kNamespaces, refusePatch,
+                                   nullptr,        nullptr,    nullptr,     nullptr};
+
+bool concerns(request_rec* r) {
+    const Configuration* c = configurationOf(r);
+    return c && TreePath::of(c->base, r->uri);
+}
+
+dav_error* addToHeader(request_rec* r, const dav_resource*, apr_text_header* text) noexcept {
+    if (contained(r, false, [r] { return concerns(r); })) apr_text_append(r->pool, text, "access-control");
+    return nullptr;
+}
+
+dav_error* addToMethods(request_rec* r, const dav_resource*, apr_text_header* text) noexcept {
+    if (contained(r, false, [r] { return concerns(r); })) apr_text_append(r->pool, text, "ACL");
+    return nullptr;
+}
+
+} // namespace
+
+const dav_liveprop_group kLiveProperties = {kProperties, kNamespaces, &kHooks};
+const dav_options_provider kOptions = {addToHeader, addToMethods, nullptr};
+
+int findLiveProperty(const dav_resource* resource, const char* space, const char* name,
+                     const dav_hooks_liveprop** hooks) noexcept {
+    const request_rec* r = requestOf(resource);
+    return r && configurationOf(r) ? dav_do_find_liveprop(space, name, &kLiveProperties, hooks) : 0;
+}
+
+void insertAllLiveProperties(request_rec* r, const dav_resource* resource, dav_prop_insert what,
+                             apr_text_header* text) noexcept {
+    if (!configurationOf(r) || what == DAV_PROP_INSERT_VALUE) return;
+    for (const dav_liveprop_spec* spec = kProperties; spec->name; ++spec)
+        insertProperty(resource, spec->propid, what, text);
+}
+
+} // namespace rolvane::davacl

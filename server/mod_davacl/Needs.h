@@ -1,0 +1,28 @@
+#pragma once
+
+#include "server/mod_davacl/Privileges.h"
+
+#include <string_view>
+#include <vector>
+
+namespace rolvane::davacl {
+
+// A privilege that a request must have, on the resource itself or on the collection that holds it.
+struct Need {
+    Privilege privilege = kRead;
+    bool onParent = false;
+    bool operator==(const Need&) const = default;
+};
+
+// What stands at the place that a request names. A server that cannot tell says nothing: more is asked for then.
+enum class Standing { nothing, file, collection };
+
+// RFC 3744 appendix B. A method that is not known needs everything.
+std::vector<Need> needsOf(std::string_view method, Standing standing);
+// The same for the place that a Destination header names.
+std::vector<Need> needsOfDestination(std::string_view method, Standing standing);
+
+// Whether a method changes what is stored.
+bool changesSomething(std::string_view method);
+
+} // namespace rolvane::davacl

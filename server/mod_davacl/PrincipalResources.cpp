@@ -1,0 +1,267 @@
+#include "server/mod_davacl/PrincipalResources.h"
+
+#include "server/mod_davacl/GroupFile.h"
+
+#include <cstring>
+#include <vector>
+
+namespace rolvane::davacl {
+namespace {
+
+// A password that nobody has: what matters is whether the provider knows the user.
+constexpr const char* kNobodysPassword = "\x01no password\x01";
+
+bool providerKnows(request_rec* r, const char* name, const std::string& user) {
+    const auto* provider =
+        static_cast<const authn_provider*>(ap_lookup_provider(AUTHN_PROVIDER_GROUP, name, AUTHN_PROVIDER_VERSION));
+    if (!provider || !provider->check_password) return false;
+    const authn_status status = provider->check_password(r, user.c_str(), kNobodysPassword);
+    return status == AUTH_DENIED || status == AUTH_GRANTED || status == AUTH_USER_FOUND;
+}
+
+// What a URL below the principals' base names.
+struct Place {
+    enum class Kind { root, users, groups, principal } kind = Kind::root;
+    Principal principal;
+};
+
+std::optional<Place> placeAt(const Configuration& c, std::string_view path) {
+    const auto tree = TreePath::of(c.principalBase(), path);
+    if (!tree || tree->below.size() > 1) return std::nullopt;
+    if (tree->isBase()) return Place{};
+    const bool users = tree->owner == "users";
+    if (!users && tree->owner != "groups") return std::nullopt;
+    if (tree->below.empty()) return Place{users ? Place::Kind::users : Place::Kind::groups, {}};
+    if (!isUsableName(tree->below[0])) return std::nullopt;
+    return Place{Place::Kind::principal, {users ? Principal::Kind::user : Principal::Kind::group, tree->below[0]}};
+}
+
+std::string pathOf(const Configuration& c, const Place& place) {
+    switch (place.kind) {
+    case Place::Kind::root: return std::string(c.principalBase()) + "/";
+    case Place::Kind::users: return userPath(c, "");
+    case Place::Kind::groups: return groupPath(c, "");
+    default: break;
+    }
+    return place.principal.kind == Principal::Kind::user ? userPath(c, place.principal.name)
+                                                         : groupPath(c, place.principal.name);
+}
+
+std::string groupText(const Configuration& c) {
+    return c.groupFile ? fileText(c.groupFile) : std::string();
+}
+
+// Who is in a group, or which groups somebody is in. Shown to whom it concerns.
+std::optional<std::string> membersOf(request_rec* r, const Configuration& c, const Principal& principal) {
+    if (principal.kind != Principal::Kind::group) return std::nullopt;
+    const auto users = usersIn(principal.name, groupText(c));
+    if (!users.contains(r->user)) return std::nullopt;
+    std::string text;
+    for (const std::string& user : users) text += hrefElement(r, userPath(c, user));
+    return text;
+}
+
+std::optional<std::string> membershipOf(request_rec* r, const Configuration& c, const Principal& principal) {
+    if (principal.kind == Principal::Kind::group) return std::string();
+    if (principal.name != r->user) return std::nullopt;
+    std::string text;
+    for (const std::string& group : groupsOf(principal.name, groupText(c))) text += hrefElement(r, groupPath(c, group));
+    return text;
+}
+
+constexpr const char* kProperties[] = {"resourcetype",
+                                       "displayname",
+                                       "principal-URL",
+                                       "alternate-URI-set",
+                                       "group-member-set",
+                                       "group-membership",
+                                       "principal-collection-set",
+                                       "current-user-principal",
+                                       "current-user-privilege-set",
+                                       "supported-privilege-set",
+                                       "acl-restrictions"};
+
+std::optional<std::string> valueOf(request_rec* r, const Configuration& c, const Place& place, std::string_view name) {
+    const bool isPrincipal = place.kind == Place::Kind::principal;
+    if (name == "resourcetype") return isPrincipal ? "<D:principal/>" : "<D:collection/>";
+    if (name == "principal-collection-set") return principalCollections(r, c);
+    if (name == "current-user-principal") return currentUserPrincipal(r, c);
+    if (name == "current-user-privilege-set") return privilegeElements(kReading);
+    if (name == "supported-privilege-set") return supportedPrivileges();
+    if (name == "acl-restrictions") return "<D:grant-only/><D:no-invert/>";
+    if (!isPrincipal) return std::nullopt;
+    if (name == "displayname") return apr_xml_quote_string(r->pool, place.principal.name.c_str(), 0);
+    if (name == "principal-URL") return hrefElement(r, pathOf(c, place));
+    if (name == "alternate-URI-set") return std::string();
+    if (name == "group-member-set") return membersOf(r, c, place.principal);
+    if (name == "group-membership") return membershipOf(r, c, place.principal);
+    return std::nullopt;
+}
+
+struct Wanted {
+    std::string space, name;
+};
+
+// What the body asks for. False when it is no DAV:propfind.
+bool readBody(const apr_xml_doc* doc, std::vector<Wanted>& wanted, bool& namesOnly) {
+    const auto all = [&wanted](size_t count) {
+        for (size_t i = 0; i < count; ++i) wanted.push_back({"DAV:", kProperties[i]});
+    };
+    if (!doc || !doc->root) {
+        all(2);
+        return true;
+    }
+    if (!dav_validate_root(doc, "propfind")) return false;
+    if (dav_find_child(doc->root, "allprop")) {
+        all(2);
+        return true;
+    }
+    if (dav_find_child(doc->root, "propname")) {
+        namesOnly = true;
+        all(std::size(kProperties));
+        return true;
+    }
+    const apr_xml_elem* prop = dav_find_child(doc->root, "prop");
+    if (!prop) return false;
+    for (const apr_xml_elem* e = prop->first_child; e; e = e->next)
+        wanted.push_back({e->ns < 0 ? "" : APR_XML_GET_URI_ITEM(doc->namespaces, e->ns), e->name});
+    return true;
+}
+
+std::string emptyElement(request_rec* r, const Wanted& property) {
+    if (property.space == "DAV:") return "<D:" + property.name + "/>";
+    return "<" + property.name + " xmlns=\"" + apr_xml_quote_string(r->pool, property.space.c_str(), 1) + "\"/>";
+}
+
+std::string propstat(const std::string& properties, const char* status) {
+    return "<D:propstat>\n<D:prop>" + properties + "</D:prop>\n<D:status>HTTP/1.1 " + status +
+           "</D:status>\n</D:propstat>\n";
+}
+
+std::string responseFor(request_rec* r, const Configuration& c, const Place& place, const std::vector<Wanted>& wanted,
+                        bool namesOnly) {
+    std::string found, missing;
+    for (const Wanted& property : wanted) {
+        const auto value = property.space == "DAV:" ? valueOf(r, c, place, property.name) : std::nullopt;
+        if (!value) {
+            if (!namesOnly) missing += emptyElement(r, property);
+            continue;
+        }
+        found += namesOnly || value->empty() ? emptyElement(r, property)
+                                             : "<D:" + property.name + ">" + *value + "</D:" + property.name + ">";
+    }
+    std::string text = "<D:response>\n" + hrefElement(r, pathOf(c, place)) + "\n";
+    if (!found.empty() || missing.empty()) text += propstat(found, "200 OK");
+    if (!missing.empty()) text += propstat(missing, "404 Not Found");
+    return text + "</D:response>\n";
+}
+
+std::vector<Place> membersOf(request_rec* r, const Configuration& c, const Place& place) {
+    std::vector<Place> members;
+    if (place.kind == Place::Kind::root) members = {{Place::Kind::users, {}}, {Place::Kind::groups, {}}};
+    if (place.kind == Place::Kind::users) members = {{Place::Kind::principal, {Principal::Kind::user, r->user}}};
+    if (place.kind == Place::Kind::groups)
+        for (const std::string& group : groupsOf(r->user, groupText(c)))
+            members.push_back({Place::Kind::principal, {Principal::Kind::group, group}});
+    return members;
+}
+
+int propfind(request_rec* r, const Configuration& c, const Place& place) {
+    const int depth = dav_get_depth(r, DAV_INFINITY);
+    if (depth < 0) return HTTP_BAD_REQUEST;
+    apr_xml_doc* doc = nullptr;
+    if (const int status = ap_xml_parse_input(r, &doc)) return status;
+    if (depth == DAV_INFINITY)
+        return dav_handle_err(
+            r,
+            dav_new_error_tag(r->pool, HTTP_FORBIDDEN, 0, 0, "Ask with Depth 0 or 1.", "DAV:", "propfind-finite-depth"),
+            nullptr);
+    std::vector<Wanted> wanted;
+    bool namesOnly = false;
+    if (!readBody(doc, wanted, namesOnly)) return HTTP_BAD_REQUEST;
+    std::string text = "<?xml version=\"1.0\" encoding=\"utf-8\"?>\n<D:multistatus xmlns:D=\"DAV:\">\n" +
+                       responseFor(r, c, place, wanted, namesOnly);
+    if (depth == 1)
+        for (const Place& member : membersOf(r, c, place)) text += responseFor(r, c, member, wanted, namesOnly);
+    text += "</D:multistatus>\n";
+    r->status = HTTP_MULTI_STATUS;
+    ap_set_content_type(r, DAV_XML_CONTENT_TYPE);
+    ap_set_content_length(r, static_cast<apr_off_t>(text.size()));
+    ap_rwrite(text.data(), static_cast<int>(text.size()), r);
+    return OK;
+}
+
+int serve(request_rec* r) {
+    const Configuration* c = configurationOf(r);
+    if (!c || !TreePath::of(c->principalBase(), r->uri)) return DECLINED;
+    if (!r->user) {
+        if (!ap_auth_type(r)) return HTTP_FORBIDDEN;
+        ap_note_auth_failure(r);
+        return HTTP_UNAUTHORIZED;
+    }
+    const auto place = placeAt(*c, r->uri);
+    if (!place || (place->kind == Place::Kind::principal && !exists(r, *c, place->principal))) return HTTP_NOT_FOUND;
+    apr_table_setn(r->headers_out, "DAV", "1, access-control");
+    apr_table_setn(r->headers_out, "Allow", "OPTIONS, PROPFIND");
+    if (std::strcmp(r->method, "OPTIONS") == 0) {
+        ap_set_content_length(r, 0);
+        return OK;
+    }
+    if (std::strcmp(r->method, "PROPFIND") == 0) return propfind(r, *c, *place);
+    return HTTP_METHOD_NOT_ALLOWED;
+}
+
+} // namespace
+
+int servePrincipals(request_rec* r) noexcept {
+    return contained(r, static_cast<int>(HTTP_INTERNAL_SERVER_ERROR), [r] { return serve(r); });
+}
+
+std::string userPath(const Configuration& c, const std::string& user) {
+    return std::string(c.principalBase()) + "/users/" + user;
+}
+
+std::string groupPath(const Configuration& c, const std::string& group) {
+    return std::string(c.principalBase()) + "/groups/" + group;
+}
+
+std::string principalElement(request_rec* r, const Configuration& c, const Principal& principal) {
+    switch (principal.kind) {
+    case Principal::Kind::user: return hrefElement(r, userPath(c, principal.name));
+    case Principal::Kind::group: return hrefElement(r, groupPath(c, principal.name));
+    default: return "<D:authenticated/>";
+    }
+}
+
+std::string principalCollections(request_rec* r, const Configuration& c) {
+    return hrefElement(r, userPath(c, "")) + hrefElement(r, groupPath(c, ""));
+}
+
+std::string currentUserPrincipal(request_rec* r, const Configuration& c) {
+    return r->user ? hrefElement(r, userPath(c, r->user)) : std::string("<D:unauthenticated/>");
+}
+
+bool exists(request_rec* r, const Configuration& c, const Principal& principal) {
+    if (principal.kind == Principal::Kind::authenticated) return true;
+    if (principal.kind == Principal::Kind::group) return groupsIn(groupText(c)).contains(principal.name);
+    if (!c.users || principal.name == r->user) return true;
+    for (int i = 0; i < c.users->nelts; ++i)
+        if (providerKnows(r, reinterpret_cast<const char* const*>(c.users->elts)[i], principal.name)) return true;
+    return false;
+}
+
+std::optional<Principal> principalAt(request_rec* r, const Configuration& c, const std::string& href) {
+    apr_uri_t uri;
+    char* text = apr_pstrdup(r->pool, href.c_str());
+    if (apr_uri_parse(r->pool, text, &uri) != APR_SUCCESS || !uri.path) return std::nullopt;
+    if (uri.hostname && (!r->hostname || strcasecmp(uri.hostname, r->hostname) != 0)) return std::nullopt;
+    if (ap_unescape_url(uri.path) != OK) return std::nullopt;
+    char* clean = apr_pstrdup(r->pool, uri.path);
+    ap_getparents(clean);
+    if (std::strcmp(clean, uri.path) != 0) return std::nullopt;
+    const auto place = placeAt(c, uri.path);
+    if (!place || place->kind != Place::Kind::principal || !exists(r, c, place->principal)) return std::nullopt;
+    return place->principal;
+}
+
+} // namespace rolvane::davacl

@@ -1,0 +1,102 @@
+#include "RawHttp.h"
+
+#include <arpa/inet.h>
+#include <netinet/in.h>
+#include <stdexcept>
+#include <sys/socket.h>
+#include <sys/time.h>
+#include <unistd.h>
+
+namespace rolvane {
+namespace {
+
+std::string base64(const std::string& text) {
+    static constexpr char digits[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
+    std::string out;
+    unsigned bits = 0;
+    int held = 0;
+    for (const unsigned char c : text) {
+        bits = bits << 8 | c;
+        for (held += 8; held >= 6; held -= 6) out += digits[bits >> (held - 6) & 63];
+    }
+    if (held) out += digits[bits << (6 - held) & 63];
+    while (out.size() % 4) out += '=';
+    return out;
+}
+
+int connectTo(int port) {
+    const int s = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    sockaddr_in address{};
+    address.sin_family = AF_INET;
+    address.sin_port = htons(static_cast<uint16_t>(port));
+    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    const timeval limit{20, 0};
+    setsockopt(s, SOL_SOCKET, SO_RCVTIMEO, &limit, sizeof limit);
+    if (connect(s, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0)
+        throw std::runtime_error("the store does not listen");
+    return s;
+}
+
+void sendAll(int s, const std::string& text) {
+    for (size_t done = 0; done < text.size();) {
+        const ssize_t count = send(s, text.data() + done, text.size() - done, MSG_NOSIGNAL);
+        if (count <= 0) return; // the answer tells why
+        done += static_cast<size_t>(count);
+    }
+}
+
+std::string headOf(const RawRequest& request) {
+    std::string text = request.method + " " + request.path + " HTTP/1.1\r\nHost: localhost\r\nConnection: close\r\n";
+    if (!request.user.empty())
+        text += "Authorization: Basic " + base64(request.user + ":" + rawPasswordOf(request.user)) + "\r\n";
+    for (const auto& [name, value] : request.headers) text += name + ": " + value + "\r\n";
+    if (!request.body.empty()) text += "Content-Length: " + std::to_string(request.body.size()) + "\r\n";
+    return text + "\r\n";
+}
+
+RawAnswer receive(int s) {
+    std::string text;
+    char part[16384];
+    for (ssize_t count = 0; (count = recv(s, part, sizeof part, 0)) > 0;) text.append(part, static_cast<size_t>(count));
+    RawAnswer answer;
+    const size_t end = text.find("\r\n\r\n");
+    if (!text.starts_with("HTTP/1.1 ") || end == std::string::npos) return answer;
+    answer.status = std::stoi(text.substr(9, 3));
+    answer.headers = text.substr(0, end + 2);
+    answer.body = text.substr(end + 4);
+    return answer;
+}
+
+} // namespace
+
+std::string rawPasswordOf(const std::string& user) {
+    return "secret of " + user;
+}
+
+std::string RawAnswer::precondition() const {
+    size_t at = body.find("<D:error");
+    if (at == std::string::npos) return {};
+    at = body.find('<', at + 1);
+    const size_t name = body.find(':', at) + 1;
+    return body.substr(name, body.find_first_of("/> ", name) - name);
+}
+
+RawAnswer rawRequest(int port, const RawRequest& request) {
+    return RawUpload(port, request, request.body.size()).finish();
+}
+
+RawUpload::RawUpload(int port, const RawRequest& request, size_t firstBytes)
+    : _socket(connectTo(port)), _rest(request.body.substr(firstBytes)) {
+    sendAll(_socket, headOf(request) + request.body.substr(0, firstBytes));
+}
+
+RawUpload::~RawUpload() {
+    close(_socket);
+}
+
+RawAnswer RawUpload::finish() {
+    sendAll(_socket, _rest);
+    return receive(_socket);
+}
+
+} // namespace rolvane

@@ -1,0 +1,42 @@
+#pragma once
+
+#include "server/PrivateStore.h"
+
+#include <optional>
+#include <string>
+#include <utility>
+#include <vector>
+
+namespace rolvane {
+
+struct RawAnswer {
+    int status = 0; // 0: no answer
+    std::string headers, body;
+    // The name of the DAV:error's child, "" when there is none.
+    std::string precondition() const;
+};
+
+// One plain HTTP/1.1 request on a connection of its own, byte for byte as given: no client library cleans the path up.
+// The path is the whole one ("/dav/alice/"). Basic authentication unless the user is "".
+struct RawRequest {
+    std::string user, method, path;
+    std::vector<std::pair<std::string, std::string>> headers = {};
+    std::string body = {};
+};
+RawAnswer rawRequest(int port, const RawRequest& request);
+std::string rawPasswordOf(const std::string& user);
+
+// A request of which the head and some of the body are sent, and the rest when asked.
+class RawUpload {
+public:
+    RawUpload(int port, const RawRequest& request, size_t firstBytes);
+    ~RawUpload();
+    RawUpload(const RawUpload&) = delete;
+    RawAnswer finish();
+
+private:
+    int _socket;
+    std::string _rest;
+};
+
+} // namespace rolvane
