@@ -67,9 +67,10 @@ std::vector<TreePath> ancestorsOf(const Asked& a) {
 std::string wholeList(const Asked& a) {
     const auto above = ancestorsOf(a);
     const auto from = [&](const TreePath& place) { return hrefOf(a.r, a.c, place); };
+    const bool hasOwn = a.place.levels() <= a.c.levels();
     std::string text = entryOf("<D:property><D:owner/></D:property>", "<D:privilege><D:all/></D:privilege>", true,
-                               above.empty() ? std::string() : from(above.back()));
-    if (a.place.levels() <= a.c.levels()) text += entriesOf(a, a.place.tree(), {});
+                               hasOwn || above.empty() ? std::string() : from(above.front()));
+    if (hasOwn) text += entriesOf(a, a.place.tree(), {});
     for (const TreePath& place : above) text += entriesOf(a, place.tree(), from(place));
     return text;
 }

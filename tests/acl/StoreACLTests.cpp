@@ -350,7 +350,7 @@ TEST_F(PublishersList, IsUnknownAndCostsNothingWhereTheStoreKeepsNoLists) {
 }
 
 TEST(PlainStoresRights, ASubscriberReadsAndTheOwnersListIsUnknown) {
-    const StoreWorld world;
+    const StoreWorld world(StoreWorld::plain());
     Client alice(world);
     ASSERT_TRUE(alice.manager.sanityCheckPublishStructureCreate(true)) << alice.wire->text();
     ASSERT_EQ(alice.write("AllCXGroup", Dictionary()) / 100, 2);

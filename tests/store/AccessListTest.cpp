@@ -487,7 +487,7 @@ TEST_F(StoreLists, AStoreThatDoesNotAnswerIsUnknown) {
 }
 
 TEST(PlainStore, KeepsNoAccessListsAndSaysSo) {
-    const StoreWorld world;
+    const StoreWorld world(StoreWorld::plain());
     Client alice(world);
     ASSERT_TRUE(alice.manager.sanityCheckPublishStructureCreate(true)) << alice.wire->text();
     EXPECT_EQ(alice.manager.keepsAccessLists(), false);
@@ -499,7 +499,7 @@ TEST(PlainStore, KeepsNoAccessListsAndSaysSo) {
 }
 
 TEST(PlainStore, AnswersAQueryThatFallsBackFromTheUnboundedDepth) {
-    const StoreWorld world;
+    const StoreWorld world(StoreWorld::plain());
     Client alice(world);
     ASSERT_TRUE(alice.manager.sanityCheckPublishStructureCreate(true));
     ASSERT_EQ(alice.write("AllCXGroup", Dictionary()) / 100, 2);

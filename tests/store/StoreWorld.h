@@ -22,6 +22,13 @@ struct StoreWorld {
         store.start();
     }
 
+    // Of a store without access lists: each user alone in the own tree.
+    static PrivateStoreOptions plain() {
+        PrivateStoreOptions options;
+        options.accessLists = false;
+        return options;
+    }
+
     PrivateStoreOptions complete(PrivateStoreOptions options) const {
         options.stateDirectory = home.path() + "/store";
         options.ownsProcess = true;
