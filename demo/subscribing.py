@@ -113,6 +113,7 @@ def open_tree(store_owner, owner, readers):
     with open(path, "rb") as file:
         options = plistlib.load(file)
     root = os.path.join(os.path.dirname(path), "root/dav", owner.name)
+    options["accessLists"] = False
     options["extraConfiguration"] = [
         f'<Directory "{root}">', "<RequireAny>", f"Require user {owner.name}", "<RequireAll>",
         f"Require user {' '.join(reader.name for reader in readers)}",
