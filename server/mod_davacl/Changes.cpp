@@ -162,6 +162,10 @@ int lookAtDestination(request_rec* r, Change& change) {
     }
     change.destination = TreePath::of(change.c->base, found.rnew->uri);
     change.destinationNeeds = needsOfDestination(r->method, standingOf(found.rnew));
+    // mod_dav would remove what is there first, and the source with it.
+    if (change.source && change.destination && change.source->isWithin(*change.destination))
+        return dav_handle_err(
+            r, dav_new_error(r->pool, HTTP_FORBIDDEN, 0, 0, "The Destination holds what would be copied."), nullptr);
     if (carriesListAway(r, change))
         return dav_handle_err(r,
                               dav_new_error(r->pool, HTTP_FORBIDDEN, 0, 0,

@@ -27,7 +27,9 @@ std::vector<Need> needsOf(std::string_view method, Standing standing) {
     if (method == "DELETE") return {{kUnbind, true}};
     if (method == "PROPPATCH") return {{kWriteProperties, false}};
     // Whose lock it is, mod_dav checks: only the one who took it gives it back.
-    if (method == "UNLOCK" || method == "POST" || method == "PATCH") return {{kWriteContent, false}};
+    if (method == "UNLOCK") return {{kWriteContent, false}};
+    // httpd answers a POST to a file with the file.
+    if (method == "POST" || method == "PATCH") return {{kRead, false}, {kWriteContent, false}};
     if (method == "ACL") return {{kWriteAcl, false}};
     std::vector<Need> everything;
     for (const unsigned bit : kAllBits) everything.push_back({static_cast<Privilege>(bit), false});

@@ -54,6 +54,12 @@ TreePath TreePath::parent() const {
     return up;
 }
 
+bool TreePath::isWithin(const TreePath& other) const {
+    if (other.isBase()) return true;
+    return owner == other.owner && below.size() >= other.below.size() &&
+           std::equal(other.below.begin(), other.below.end(), below.begin());
+}
+
 bool TreePath::isReserved() const {
     return isReservedSegment(owner) || std::any_of(below.begin(), below.end(), isReservedSegment);
 }

@@ -259,15 +259,18 @@ TEST_F(AccessLists, ThatCannotGoAlongKeepTheirTreeWhereItIs) {
 }
 
 TEST_F(AccessLists, AWriteThatBeganBeforeItsRightWasWithdrawnDoesNotLand) {
-    RawUpload upload(world->port(), {"walter", "PUT", "/dav/alice/Contacts/dateFile", {}, "too late"}, 3);
-    // The server has read the head and waits for the rest; the withdrawal is acknowledged meanwhile.
+    RawUpload upload(world->port(),
+                     {"walter", "PUT", "/dav/alice/Contacts/dateFile", {{"Expect", "100-continue"}}, "too late"}, 0);
+    ASSERT_TRUE(upload.awaitContinue()) << "it was allowed when it began";
     EXPECT_EQ(set("").status, 200);
     EXPECT_EQ(upload.finish().status, 403);
     EXPECT_EQ(world->ask("alice", "GET", "/dav/alice/Contacts/dateFile").body, "why");
 }
 
 TEST_F(AccessLists, ASlowWriterDoesNotKeepTheOwnerWaiting) {
-    RawUpload upload(world->port(), {"walter", "PUT", "/dav/alice/Contacts/new", {}, "slow"}, 1);
+    RawUpload upload(world->port(), {"walter", "PUT", "/dav/alice/Contacts/new", {{"Expect", "100-continue"}}, "slow"},
+                     0);
+    ASSERT_TRUE(upload.awaitContinue());
     EXPECT_EQ(set(AccessWorld::ace(AccessWorld::user("walter"), "read write")).status, 200);
     EXPECT_EQ(upload.finish().status, 201) << "who still may write is not disturbed";
 }

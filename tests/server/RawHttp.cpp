@@ -94,6 +94,13 @@ RawUpload::~RawUpload() {
     close(_socket);
 }
 
+bool RawUpload::awaitContinue() {
+    std::string text;
+    char c = 0;
+    while (!text.ends_with("\r\n\r\n") && recv(_socket, &c, 1, 0) == 1) text += c;
+    return text.starts_with("HTTP/1.1 100 ");
+}
+
 RawAnswer RawUpload::finish() {
     sendAll(_socket, _rest);
     return receive(_socket);

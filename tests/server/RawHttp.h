@@ -32,6 +32,8 @@ public:
     RawUpload(int port, const RawRequest& request, size_t firstBytes);
     ~RawUpload();
     RawUpload(const RawUpload&) = delete;
+    // Until the server asks for the body of a request with "Expect: 100-continue": it is in the middle of handling it.
+    bool awaitContinue();
     RawAnswer finish();
 
 private:
