@@ -154,7 +154,7 @@ CXDChangeRecords CXDConduit::comparePriorStateToCurrentState(const Dictionary& p
 void CXDConduit::compareUser(const UserName& user, const Dictionary& prior, const Dictionary& current,
                              CXDChangeRecords& records) {
     const Dictionary now = current[user.str()].dictionary();
-    const Value serial = now[kSerialNumber];
+    const Value& serial = now[kSerialNumber];
     const auto base = baseLocationForUser(user); // of the user as it stands, "<self>" included
     if (!serial.isString() || !base) return;     // could not be read, or is no store of ours
     const RemoteLocation baseText(base->absoluteString());
