@@ -3,6 +3,7 @@
 #include "foundation/CXException.h"
 
 #include <algorithm>
+#include <array>
 #include <cerrno>
 #include <csignal>
 #include <cstdlib>
@@ -96,10 +97,13 @@ StoreIdentity StoreIdentity::choose() {
     identity.gid = getegid();
     if (identity.uid != 0) return identity;
     for (const char* name : {"www-data", "nobody"}) {
-        if (const passwd* entry = getpwnam(name)) {
+        passwd entry{};
+        passwd* found = nullptr;
+        std::array<char, 16384> texts{}; // glibc's own bound for an entry is 1024
+        if (getpwnam_r(name, &entry, texts.data(), texts.size(), &found) == 0 && found) {
             identity.change = true;
-            identity.uid = entry->pw_uid;
-            identity.gid = entry->pw_gid;
+            identity.uid = found->pw_uid;
+            identity.gid = found->pw_gid;
             identity.name = name;
             return identity;
         }

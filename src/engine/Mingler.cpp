@@ -1,5 +1,6 @@
 #include "engine/Mingler.h"
 
+#include "contacts/Constants.h"
 #include "engine/RecordIdentity.h"
 #include "foundation/Log.h"
 
@@ -24,13 +25,33 @@ bool present(const std::optional<Text>& a, const std::optional<Text>& b) {
     return a && b && *a == *b;
 }
 
+bool takesGroupOut(const CXDChangeRecord& record) {
+    return record.type() == CXDDeleteGroup;
+}
+
+// Who leaves the all-contacts group leaves the database.
+bool takesPersonOut(const CXDChangeRecord& record) {
+    return record.type() == CXDDeleteRecord ||
+           ((record.type() == CXDRemoveRecordFromGroup || record.type() == CXDRemoveGroupFromGroup) && record.group() &&
+            record.group()->str() == kCXAllGroupUID);
+}
+
+// Two of the owner's changes stand side by side (somebody joins a group, somebody else leaves it, in one save), unless
+// the later one undoes the earlier: it concerns the same member of the same group, or one of them takes out of the
+// database what the other changes.
+bool areOwnersBoth(const CXDChangeRecord& a, const CXDChangeRecord& b) {
+    return a.changeMadeByDataOwner() && b.changeMadeByDataOwner();
+}
+
 bool personsContradict(const CXDChangeRecord& a, const CXDChangeRecord& b) {
-    return present(a.person(), b.person()) && isRemoval(a) != isRemoval(b);
+    return present(a.person(), b.person()) && isRemoval(a) != isRemoval(b) &&
+           (!areOwnersBoth(a, b) || a.group() == b.group() || takesPersonOut(a) || takesPersonOut(b));
 }
 
 bool groupsContradict(const CXDChangeRecord& a, const CXDChangeRecord& b) {
     return present(a.group(), b.group()) && a.type() != CXDUpdateDistributionList &&
-           b.type() != CXDUpdateDistributionList && isRemoval(a) != isRemoval(b);
+           b.type() != CXDUpdateDistributionList && isRemoval(a) != isRemoval(b) &&
+           (!areOwnersBoth(a, b) || takesGroupOut(a) || takesGroupOut(b));
 }
 
 enum class Outcome { nothing, elementLoses, recordLoses };
@@ -187,17 +208,20 @@ public:
         std::vector<uint32_t> found;
         if ((isRemoval(record) ? _others : _removals) == 0) return found; // nothing here can contradict it
         if (!_byIdentifierBuilt) buildByIdentifier();
-        const bool all = record.changeMadeByDataOwner() || debugLevel() != 0;
-        const auto gather = [&](ByIdentifier& index, const std::optional<UniqueId>& identifier) {
+        const bool isOwners = record.changeMadeByDataOwner();
+        const bool all = isOwners || debugLevel() != 0;
+        const auto gather = [&](ByIdentifier& index, const std::optional<UniqueId>& identifier, bool onlyTakers) {
             if (!identifier) return;
             const auto it = index.find(*identifier);
             if (it == index.end()) return;
             Candidates& opposite = it->second[isRemoval(record) ? 0 : 1];
-            collect(opposite.owners, stop, all, found);
+            collect(onlyTakers ? opposite.takers : opposite.owners, stop, all, found);
             if (all) collect(opposite.others, stop, all, found);
         };
-        gather(_byPerson, record.person());
-        if (record.type() != CXDUpdateDistributionList) gather(_byGroup, record.group());
+        gather(_byPerson, record.person(), false);
+        // A group has many members, and few of its owner's changes touch each other.
+        if (record.type() != CXDUpdateDistributionList)
+            gather(_byGroup, record.group(), isOwners && !takesGroupOut(record));
         std::sort(found.begin(), found.end(), std::greater<>());
         found.erase(std::unique(found.begin(), found.end()), found.end());
         return found;
@@ -207,6 +231,7 @@ private:
     // Ascending; what has been removed since is dropped when it comes to the top.
     struct Candidates {
         std::vector<uint32_t> owners, others;
+        std::vector<uint32_t> takers; // of the owners': what takes the group out
     };
     using ByIdentifier = std::unordered_map<UniqueId, std::array<Candidates, 2>>; // [is a removal]
 
@@ -232,6 +257,7 @@ private:
             if (!identifier) return;
             Candidates& same = index[*identifier][isRemoval(record) ? 1 : 0];
             (record.changeMadeByDataOwner() ? same.owners : same.others).push_back(element);
+            if (record.changeMadeByDataOwner() && takesGroupOut(record)) same.takers.push_back(element);
         };
         add(_byPerson, record.person());
         if (record.type() != CXDUpdateDistributionList) add(_byGroup, record.group());

@@ -8,8 +8,9 @@
 namespace rolvane {
 
 // Settles conflicts among the records of a pass: duplicates are dropped, and the owner's change wins over a
-// subscriber's when one takes something away and the other does not. Records go in one by one, in order of arrival; the
-// accepted ones come out in that order.
+// subscriber's when one takes something away and the other does not. Of two changes by the owner the later one wins
+// only where it undoes the earlier: the same member of the same group, or one takes out what the other changes. Records
+// go in one by one, in order of arrival; the accepted ones come out in that order.
 //
 // Every identifier, a person's or a group's, has a bucket of the records accepted for it. A record is compared with its
 // buckets' elements from the latest to the earliest. A long bucket is indexed by what can equal or contradict a

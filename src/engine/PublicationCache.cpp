@@ -78,7 +78,7 @@ void foldComposite(Dictionary& state, const Dictionary& payload) {
     if (const Dictionary* added = payload[kDistributionListAdds].dictionaryIf()) distribution.addEntriesFrom(*added);
     if (const Array* removed = payload[kDistributionListRemoves].arrayIf())
         for (const Value& person : *removed) distribution.remove(person.string());
-    if (const Value name = payload[kCXGroupNameProperty]) state.set(kCXGroupNameProperty, name);
+    if (const Value& name = payload[kCXGroupNameProperty]) state.set(kCXGroupNameProperty, name);
 }
 
 void foldAccessList(Dictionary& state, const CXDChangeRecord& record) {

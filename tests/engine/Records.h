@@ -31,7 +31,7 @@ inline CXDChangeRecordPtr makeRecord(int32_t type, const char* person, const cha
 inline rc::Gen<CXDChangeRecordPtr> arbitraryRecord() {
     return rc::gen::exec([] {
         static const std::vector<const char*> persons = {nullptr, "P1", "P2", "G1"};
-        static const std::vector<const char*> groups = {nullptr, "G1", "G2", "P1", "People"};
+        static const std::vector<const char*> groups = {nullptr, "G1", "G2", "P1", "People", "AllCXGroup"};
         static const std::vector<const char*> users = {"<self>", "ann", "bob"};
         const int32_t type =
             *rc::gen::elementOf(std::vector<int32_t>{1, 2, 3, 4, 5, 6, 7, 8, 9, 257, 258, 259, 260, 261});
