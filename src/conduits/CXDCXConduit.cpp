@@ -99,6 +99,7 @@ CXDChangeRecords CXDCXConduit::changeRecords() {
          {groupsModifiedAfter<CXGroup>(since), groupsModifiedAfter<CXSubscribedGroup>(since)})
         for (const CXRecordRef& group : rolvane().recordsMatchingSearchElement(modified))
             capture.addGroup(std::dynamic_pointer_cast<CXGroup>(group));
+    addUnsettledGroups(capture);
     for (const std::string_view table : {kCXPersonTable, kCXSubscribedPersonTable})
         rolvane().forEachPersonModifiedSince(since, table, [&](const CXRow& person) {
             if (person.writer != ownProgram()) capture.addPerson(person, true);
@@ -121,6 +122,18 @@ bool CXDCXConduit::saysSomething(const CXSubscription& subscription) const {
         return true;
     const CXAllGroupRef group = rolvane().allGroupForRemoteLocation(location);
     return group && (group->memberCount() > 0 || !group->subgroupUniqueIds().empty());
+}
+
+// Groups that a former pass may have left on the store in an older state. (All-contacts groups are compared anyway.)
+void CXDCXConduit::addUnsettledGroups(ChangeCapture& capture) {
+    const Dictionary unsettled = engine().conduitObjectForKey(kConduitCX, kUnsettledGroups);
+    engine().setConduitObjectForKey(kConduitCX, Dictionary(), kUnsettledGroups);
+    for (const auto& [identifier, isSo] : unsettled)
+        for (const std::string_view table : {kCXGroupTable, kCXSubscribedGroupTable}) {
+            const UniqueId uid = cxUIDWithTableName(UniqueId(identifier), table);
+            if (const auto group = std::dynamic_pointer_cast<CXGroup>(rolvane().recordForUniqueId(uid)))
+                capture.addGroup(group);
+        }
 }
 
 // -- other processes' saves

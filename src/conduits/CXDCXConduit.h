@@ -128,6 +128,7 @@ private:
     Dictionary priorState() const;
     ChangeCapture newCapture() const;
     bool saysSomething(const CXSubscription& subscription) const;
+    void addUnsettledGroups(ChangeCapture& capture);
     const std::string& ownProgram() const;
     bool dispatch(const CXDChangeRecordPtr& record);
     // What the record names, where it is there, of the right kind and the record's to change; else null.

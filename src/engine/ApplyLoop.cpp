@@ -5,8 +5,11 @@
 #include "engine/Mingler.h"
 #include "engine/OutOfOrderWork.h"
 #include "engine/PublicationCache.h"
+#include "engine/UnsettledGroups.h"
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "model/PayloadKeys.h"
+#include "model/RemoteLocationMap.h"
 #include "store/CXFileManager.h"
 
 #include <algorithm>
@@ -112,8 +115,10 @@ void ApplyLoop::applyAll(bool trickle) {
         _parts.conduits.cx->open();
         _parts.conduits.vaultra->open();
     }
+    const size_t fresh = _unhandled.size();
     append(_unhandled, _parts.state.getPendingChanges());
     _queueTaken = true;
+    _unsettled = unsettledGroups(_unhandled, fresh);
     queue();
     _parts.with.progress.startedPhase(3);
     split();
@@ -226,13 +231,21 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
     _parts.with.rolvane.save();
     _parts.state.setPendingChanges(_pendingChanges);
     _queueStored = true;
+    const bool lookAgain = noteUnsettled() && _pendingChanges.empty();
     _pendingChanges.clear();
-    if (!_parts.denied.empty()) {
+    if (!_parts.denied.empty() || lookAgain) {
         _parts.denied.clear();
         if (allowRetry) _actions.scheduleRetry();
     }
     _parts.conduits.cx->close();
     _parts.conduits.vaultra->close();
+}
+
+// The next scan takes them from there. False when there are none.
+bool ApplyLoop::noteUnsettled() {
+    if (_unsettled.empty()) return false;
+    _parts.state.conduitObjectForKey(kConduitCX, kUnsettledGroups).addEntriesFrom(_unsettled);
+    return true;
 }
 
 // Account and conduit data are put down first, so that they reach the disk in one piece with the share count. They

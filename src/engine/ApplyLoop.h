@@ -44,6 +44,7 @@ private:
     void cleanUp();
     void carryOver();
     void storeAndClose(bool allowRetry);
+    bool noteUnsettled();
     void bumpShareCount();
 
     EngineParts& _parts;
@@ -52,6 +53,7 @@ private:
     bool _queueTaken = false;    // the stored queue is part of the pass
     bool _queueStored = false;
     CXDChangeRecords _pendingChanges;
+    Dictionary _unsettled; // groups whose changes may have been applied in another order than they were made
     CXDChangeRecords _inOrder;
     size_t _inOrderDone = 0;
     std::unique_ptr<OutOfOrderWork> _outOfOrder;

@@ -1,6 +1,6 @@
 #include "engine/Mingler.h"
 
-#include "contacts/Constants.h"
+#include "contacts/Identifier.h"
 #include "engine/RecordIdentity.h"
 #include "foundation/Log.h"
 

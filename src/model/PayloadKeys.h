@@ -21,5 +21,7 @@ inline constexpr const char* kDistributionListState = "distributionListState"; /
 
 // Where a conduit's prior state stands in its data: user to group identifier to group state.
 inline constexpr const char* kPriorState = "priorState";
+// Beside it, for the contact database: identifier -> true, groups that the next scan compares whatever their date.
+inline constexpr const char* kUnsettledGroups = "unsettledGroups";
 
 } // namespace rolvane

@@ -197,6 +197,76 @@ TEST_F(StartUp, DaemonsOfTwoUsersDoNotMindEachOther) {
     EXPECT_TRUE(second->running());
 }
 
+// Published, and the same on the store.
+std::unique_ptr<ChildProcess> servingGroups(DaemonWorld& world) {
+    world.bus();
+    world.addPeople(6);
+    world.saveAccountOn(world.store());
+    CXRolvane& database = world.database();
+    for (const char* uid : {"A:CXGroup", "B:CXGroup"}) {
+        const CXGroupRef group = CXGroup::initWithUniqueId(UniqueId(uid));
+        group->setValue(uid, kCXGroupNameProperty);
+        database.addRecord(group);
+        for (const CXPersonRef& person : database.allGroup()->members()) group->addMember(person);
+    }
+    database.save();
+    world.publishEverything();
+    auto daemon = world.serving();
+    for (int i = 0; i < 600 && !world.differences().empty(); ++i) daemon->wait(0.05);
+    return daemon;
+}
+
+CXGroupRef groupNamed(DaemonWorld& world, const char* uid) {
+    return std::dynamic_pointer_cast<CXGroup>(world.database().recordForUniqueId(UniqueId(uid)));
+}
+
+TEST_F(StartUp, AGroupThatChangesInEveryWayInOneSaveIsOnTheStoreAsItIs) {
+    const auto daemon = servingGroups(world);
+    ASSERT_EQ(world.differences(), "") << daemon->errors();
+    const CXGroupRef a = groupNamed(world, "A:CXGroup"), b = groupNamed(world, "B:CXGroup");
+    const auto members = a->members();
+    const CXPersonRef newcomer = CXPerson::create();
+    newcomer->setValue("Newcomer", kCXFirstNameProperty);
+    world.database().addRecord(newcomer);
+    a->addMember(newcomer);
+    a->removeMember(members[0]);
+    a->addSubgroup(b);
+    b->removeMember(members[1]);
+    members[1]->setValue("an edit", kCXNoteProperty);
+    a->setValue("Renamed", kCXGroupNameProperty);
+    world.database().save();
+    for (int i = 0; i < 200 && !world.differences().empty(); ++i) daemon->wait(0.05);
+    EXPECT_EQ(world.differences(), "") << daemon->errors();
+}
+
+TEST_F(StartUp, WhatAGroupGoesThroughWhileTheStoreIsAwayEndsAsItIs) {
+    const auto daemon = servingGroups(world);
+    ASSERT_EQ(world.differences(), "") << daemon->errors();
+    world.store().stop(PrivateStore::Stop::atOnce);
+    const CXGroupRef a = groupNamed(world, "A:CXGroup");
+    const auto members = a->members();
+    const auto save = [&](size_t passes) {
+        world.database().save();
+        for (int i = 0; i < 600 && linesWith(daemon->errors(), "TRICKLE") < passes; ++i) daemon->wait(0.02);
+        ASSERT_GE(linesWith(daemon->errors(), "TRICKLE"), passes) << daemon->errors();
+    };
+    const size_t before = linesWith(daemon->errors(), "TRICKLE");
+    a->setValue("First", kCXGroupNameProperty);
+    a->removeMember(members[0]);
+    save(before + 1);
+    a->setValue("Second", kCXGroupNameProperty);
+    a->addMember(members[0]);
+    a->removeMember(members[1]);
+    save(before + 2);
+    a->setValue("Third", kCXGroupNameProperty);
+    a->removeMember(members[2]);
+    save(before + 3);
+    world.store().start();
+    world.rolvane({"sync"});
+    for (int i = 0; i < 200 && !world.differences().empty(); ++i) daemon->wait(0.05);
+    EXPECT_EQ(world.differences(), "") << daemon->errors();
+}
+
 TEST_F(StartUp, AnEditOfAnotherProcessIsCarriedToTheStore) {
     world.bus();
     world.addPeople(2);

@@ -7,8 +7,8 @@
 
 #include <algorithm>
 #include <future>
-#include <map>
 #include <gtest/gtest.h>
+#include <map>
 
 namespace rolvane {
 namespace {
