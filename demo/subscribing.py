@@ -1,13 +1,12 @@
 """The two-sided part: an owner and a subscriber, each with a home, a session bus and a daemon of their own."""
 
 import os
-import plistlib
 import re
 import subprocess
 import time
 
-from steps import Step, check, check_copies, records, say, sign_up, summary
-from storeview import normal
+from steps import PASSWORD, Step, check, check_copies, records, say, sign_up, summary
+from storeview import StoreView, normal
 from world import Failure, Person, wait_until
 
 PASS_SECONDS = 60
@@ -93,9 +92,61 @@ def refused_edit(owner, subscriber):
     check("read but not changed" in said, f"{subscriber.name} may not edit {copy['name']}: exit code {code}")
 
 
-def withdrawal(owner, subscriber):
+def subscriber_edits(owner, subscriber):
+    """Who may write edits the copies; each edit arrives in a pass of the owner's."""
+    people, groups = (list(part.values()) for part in records(subscriber, "--of", owner.name))
+    edited, victim = people[21], people[33]
+    group = next(g for g in groups if len(g["members"]) > 3)
+    leaver = next(uid for uid in group["members"] if normal(uid) not in
+                  (normal(edited["identifier"]), normal(victim["identifier"])))
+
+    def mine():
+        return records(owner, "--own")
+
+    carried("an edit of the subscriber's", subscriber, owner,
+            lambda: subscriber.run("edit", edited["identifier"], "--nickname", "From cleo, ß 語"),
+            lambda _: mine()[0][normal(edited["identifier"])]["properties"].get("Nickname") == "From cleo, ß 語")
+    carried("a member that the subscriber takes out of a group", subscriber, owner,
+            lambda: subscriber.run("group", "remove", group["identifier"], leaver),
+            lambda _: normal(leaver) not in [normal(m) for m in mine()[1][normal(group["identifier"])]["members"]])
+    carried("a group that the subscriber renames", subscriber, owner,
+            lambda: subscriber.run("group", "rename", group["identifier"], "Cleo's name"),
+            lambda _: mine()[1][normal(group["identifier"])]["name"] == "Cleo's name")
+    carried("a person whom the subscriber deletes", subscriber, owner,
+            lambda: subscriber.run("delete", victim["identifier"], "--yes"),
+            lambda _: normal(victim["identifier"]) not in mine()[0])
+
+
+def tree(view):
+    """Every contact and group on the store with its contents; the clock file is left out."""
+    found = {}
+    for bucket in range(32):
+        for uid in view.names("People", str(bucket))[0]:
+            found[uid] = view.contact(uid)
+    files, directories = view.names()
+    for name in files | directories:
+        if name.endswith("CXGroup"):
+            found[name] = view.plist(name)
+    return found
+
+
+def unsubscription(owner, subscriber, view):
+    """Ends a subscription that may write, and begins it again: nothing of it is carried to the owner's tree."""
+    before = tree(view)
+    talk(subscriber, "unsubscribe", owner.name)
+    left = [r for r in subscriber.json("list") + subscriber.json("group", "list") if r["owner"]]
+    subscriber.run("sync")
+    owner.run("sync")
+    check(not left and tree(view) == before,
+          f"no copy is left, and the owner's tree of {len(before)} contacts and groups is as it was")
+    talk(subscriber, "subscribe", owner.name)
+    check_copies(owner, subscriber, "subscribed again")
+
+
+def withdrawal(owner, subscriber, withdraw):
+    """The owner withdraws; the copies leave, are kept, and the person learns of it."""
     count = len(subscriber.json("list", "--of", owner.name))
-    talk(owner, "unpublish")
+    withdraw()
     began = time.monotonic()
     subscriber.run("sync")
     gone = time.monotonic() - began
@@ -103,34 +154,35 @@ def withdrawal(owner, subscriber):
     left = [p for p in subscriber.json("list") if p["owner"]]
     check(not left and subscriber.json("subscriptions") == [],
           f"the {count} copies have left, and the subscription with them, in a pass of {gone:.2f} s")
-    return count
+    notice = subscriber.json("status")["withdrawn"][0]
+    check(notice["user"] == owner.name and notice["people"] == count and os.path.exists(notice["file"]),
+          f"the notice is in `rolvane status`, and {count} people are kept in {os.path.basename(notice['file'])}")
+    for line in subscriber.run("status").splitlines():
+        if line.startswith("Withdrawn"):
+            say(f"{subscriber.name}: {' '.join(line.split())}")
+    return notice
 
 
-def open_tree(store_owner, owner, readers):
-    """Lets others read a tree on a store that keeps no access lists: its administrator's configuration says so."""
-    path = os.path.join(store_owner.environment["XDG_STATE_HOME"], "rolvane/store/store.plist")
-    store_owner.run("store", "stop")
-    with open(path, "rb") as file:
-        options = plistlib.load(file)
-    root = os.path.join(os.path.dirname(path), "root/dav", owner.name)
-    options["accessLists"] = False
-    options["extraConfiguration"] = [
-        f'<Directory "{root}">', "<RequireAny>", f"Require user {owner.name}", "<RequireAll>",
-        f"Require user {' '.join(reader.name for reader in readers)}",
-        "Require method GET HEAD OPTIONS PROPFIND REPORT", "</RequireAll>", "</RequireAny>", "</Directory>"]
-    with open(path, "wb") as file:
-        plistlib.dump(options, file)
-    store_owner.run("store", "start")
+def taken_back(subscriber, notice):
+    report = subscriber.json("withdrawn", "import", notice["name"])
+    check(report["imported"] == notice["people"] and report["bad"] == 0,
+          f"`rolvane withdrawn import` takes all {report['imported']} back as {subscriber.name}'s own")
 
 
 def subscription(world, owner, endpoint, authority):
-    subscriber = Person("cleo", owner.build, world.root)
-    world.at_end(subscriber.leave)
-    sign_up(subscriber, owner, endpoint, authority)
-    with Step("A stranger's subscription is refused"):
-        code, said = talk(subscriber, "subscribe", owner.name, may=(5,))
-        check("does not let you read" in said, f"exit code {code}")
-    open_tree(owner, owner, [subscriber])
+    subscriber, stranger = (Person(name, owner.build, world.root) for name in ("cleo", "dan"))
+    for person in (subscriber, stranger):
+        world.at_end(person.leave)
+        sign_up(person, owner, endpoint, authority)
+    view = StoreView(endpoint, owner.name, PASSWORD, authority)
+    with Step("Nothing is shared with anybody yet"):
+        for person in (subscriber, stranger):
+            code, said = talk(person, "subscribe", owner.name, may=(5,))
+            check("does not let you read" in said, f"{person.name} gets nothing: exit code {code}")
+    with Step("The owner shares for reading"):
+        talk(owner, "share", subscriber.name)
+        check(owner.json("shares") == [{"user": "cleo", "rights": "read", "store": "read", "agrees": True}],
+              "the store has it")
     with Step("Subscribe to the contacts of another user"):
         began = time.monotonic()
         talk(subscriber, "subscribe", owner.name)
@@ -140,5 +192,24 @@ def subscription(world, owner, endpoint, authority):
     with Step("The owner edits, adds, deletes, renames and regroups"):
         owner_edits(owner, subscriber)
         check_copies(owner, subscriber, "after the owner's edits")
-    with Step("The owner withdraws"):
-        withdrawal(owner, subscriber)
+    with Step("The owner shares for writing, and the subscriber edits"):
+        talk(owner, "share", subscriber.name, "--write")
+        carried("the right to write", owner, subscriber, lambda: None,
+                lambda _: subscriber.json("subscriptions")[0]["writable"])
+        subscriber_edits(owner, subscriber)
+        subscriber.run("sync")
+        check_copies(owner, subscriber, "after the subscriber's edits")
+    with Step("The subscriber, who may write, unsubscribes and subscribes again"):
+        unsubscription(owner, subscriber, view)
+    with Step("The owner takes the rights back"):
+        withdrawal(owner, subscriber, lambda: talk(owner, "unshare", subscriber.name))
+        check(owner.json("shares") == [], "the store has it")
+    with Step("The owner shares again, and withdraws the publication"):
+        talk(owner, "share", subscriber.name)
+        talk(subscriber, "subscribe", owner.name)
+        check_copies(owner, subscriber, "subscribed once more")
+        notice = withdrawal(owner, subscriber, lambda: talk(owner, "unpublish"))
+        taken_back(subscriber, notice)
+    with Step("A third user, never granted anything"):
+        code, _ = talk(stranger, "subscribe", owner.name, may=(3, 5))
+        check(stranger.json("list") == [], f"has nothing: exit code {code}")

@@ -1,4 +1,5 @@
 #include "Context.h"
+#include "ImportReport.h"
 #include "Lookup.h"
 #include "PersonFields.h"
 #include "RecordJson.h"
@@ -28,19 +29,6 @@ struct ImportOptions {
     std::string group;
 };
 
-Json importReport(const VCardImportReport& report) {
-    Json errors = Json::array();
-    for (const VCardError& error : report.errors)
-        errors.push_back({{"file", error.file}, {"line", error.line}, {"reason", error.reason}});
-    return {{"imported", report.imported},
-            {"updated", report.updated},
-            {"unchanged", report.unchanged},
-            {"groups", report.groups},
-            {"missingMembers", report.missingMembers},
-            {"bad", report.errorCount},
-            {"errors", errors}};
-}
-
 void importCards(Context& context, const ImportOptions& options) {
     VCardImportReport report;
     size_t unreadable = 0; // files
@@ -63,17 +51,7 @@ void importCards(Context& context, const ImportOptions& options) {
             }
         report = import.finish();
     }
-    for (const VCardError& error : report.errors)
-        context.warn(fmt::format("{}:{}: {}", error.file, error.line, error.reason));
-    if (report.errorCount > report.errors.size())
-        context.warn(fmt::format("and {} more bad cards", report.errorCount - report.errors.size()));
-    if (context.json)
-        context.print(importReport(report));
-    else
-        context.say(fmt::format("{} imported, {} updated, {} unchanged, {} groups, {} bad cards left out.",
-                                report.imported, report.updated, report.unchanged, report.groups, report.errorCount));
-    if (report.errorCount + unreadable > 0)
-        context.exitCode = report.imported + report.updated + report.unchanged + report.groups > 0 ? kPartly : kFailed;
+    reportImport(context, report, unreadable);
 }
 
 // export ---------------------------------------------------------------------------------------------------------

@@ -2,6 +2,7 @@
 #include "PassWatch.h"
 #include "Publication.h"
 #include "Subscriptions.h"
+#include "Withdrawn.h"
 
 #include "daemon/DaemonControl.h"
 #include "engine/EngineState.h"
@@ -74,6 +75,7 @@ Json status(Context& context) {
             {"store", storeStatus()},
             {"published", {{"everything", publication.everything()}, {"groups", groups}}},
             {"subscriptions", subscriptions},
+            {"withdrawn", withdrawnJson()},
             {"pending", EngineState(preferences).getPendingChanges().size()},
             {"lastPass", dateOrNull(preferences.get(kDaemonDomain, kCXDCXConduitLastSyncDate))},
             {"lastStorePass", dateOrNull(preferences.get(kDaemonDomain, kCXDVaultraConduitLastSyncDate))}};
@@ -117,6 +119,7 @@ void showStatus(Context& context) {
     }
     row("Published", publishedText(s["published"]));
     row("Subscribed", subscribedText(s["subscriptions"]));
+    for (const Json& record : s["withdrawn"]) row("Withdrawn", withdrawnText(record));
     row("Waiting", fmt::format("{} change{}", pending, pending == 1 ? "" : "s"));
     row("Last pass", s["lastPass"].is_null() ? "never" : s["lastPass"].get<std::string>());
 }

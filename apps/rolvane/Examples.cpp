@@ -35,6 +35,13 @@ const std::map<std::string, const char*>& examples() {
                     "  rolvane publish --group Family"},
         {"unpublish", "  rolvane unpublish --group Family\n"
                       "  rolvane unpublish --keep"},
+        {"share", "  rolvane share bob\n"
+                  "  rolvane share carol --write"},
+        {"unshare", "  rolvane unshare bob"},
+        {"shares", "  rolvane shares --json"},
+        {"rights", "  rolvane rights bob"},
+        {"withdrawn list", "  rolvane withdrawn list"},
+        {"withdrawn import", "  rolvane withdrawn import bob"},
         {"subscribe", "  rolvane subscribe bob\n"
                       "  rolvane subscribe http://dav.example.org/bob/Contacts --no-wait"},
         {"unsubscribe", "  rolvane unsubscribe bob"},

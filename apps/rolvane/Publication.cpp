@@ -1,5 +1,7 @@
 #include "Publication.h"
 
+#include "Shares.h"
+
 #include "contacts/Constants.h"
 #include "contacts/Identifier.h"
 #include "engine/EngineState.h"
@@ -70,6 +72,7 @@ bool Publication::publishEverything(const Url& base) {
 bool Publication::publishGroup(const CXGroupRef& group, const Url& base) {
     const bool changed = publishAt(*group, base);
     if (changed) settle();
+    Shares(_database).settle();
     return changed;
 }
 
@@ -84,7 +87,8 @@ bool Publication::withdrawEverything() {
 
 bool Publication::withdrawGroup(const CXGroupRef& group) {
     if (!isPublished(*group)) return false;
-    group->removeValueForProperty(kCXRemoteLocationProperty);
+    for (const char* property : {kCXRemoteLocationProperty, kCXReadSharingACLProperty, kCXReadWriteSharingACLProperty})
+        group->removeValueForProperty(property);
     settle();
     return true;
 }

@@ -32,29 +32,6 @@ std::string counted(size_t count, const char* one, const char* several) {
     return fmt::format("{} {}", count, count == 1 ? one : several);
 }
 
-// The location that the words name on the account's store, as the daemon will ask for it.
-RemoteLocation namedLocation(const std::string& named) {
-    const auto baseOf = [](const std::string& user) {
-        return RemoteLocation(CXDAVManager::ostrelBaseLocationForOstrelUser(UserName(user)).absoluteString());
-    };
-    if (named.empty()) throw CommandError(kUsage, "Name the user whose contacts you want.");
-    const bool isLocation = named.find(':') != std::string::npos || named.find('/') != std::string::npos;
-    if (!isLocation) return baseOf(named);
-    std::string text = named;
-    while (text.ends_with('/')) text.pop_back();
-    const RemoteLocation location(text);
-    if (syncSourceForRemoteLocation(location) != CXDSyncSourceVaultra)
-        throw CommandError(kUsage, fmt::format("\"{}\" is no location of a store. Give the user's name, or a location "
-                                               "like {}.",
-                                               named, baseOf("alice").str()));
-    const std::string user = publisherOf(location);
-    if (user.empty() || baseOf(user) != location)
-        throw CommandError(kNotFound, fmt::format("{} is not on the store of your account, where locations are like "
-                                                  "{}. Give the user's name instead.",
-                                                  named, baseOf(user.empty() ? "alice" : user).str()));
-    return location;
-}
-
 // Asks the store whether there is something that may be read, and says clearly why not.
 void requirePublication(const RemoteLocation& location) {
     const std::string user = publisherOf(location), self = CXDAVManager::vaultraUser();

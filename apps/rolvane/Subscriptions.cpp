@@ -3,8 +3,10 @@
 #include "Context.h"
 #include "Publication.h"
 
+#include "conduits/PublishedLayout.h"
 #include "engine/EngineState.h"
 #include "model/RemoteLocationMap.h"
+#include "store/CXDAVManager.h"
 
 #include <algorithm>
 #include <fmt/format.h>
@@ -26,6 +28,34 @@ std::string folded(std::string text) {
 std::string publisherOf(const RemoteLocation& location) {
     const auto user = userForRemoteLocation(location, std::nullopt, {});
     return user ? user->str() : std::string();
+}
+
+RemoteLocation namedLocation(const std::string& named) {
+    const auto baseOf = [](const std::string& user) {
+        return RemoteLocation(CXDAVManager::ostrelBaseLocationForOstrelUser(UserName(user)).absoluteString());
+    };
+    if (named.empty()) throw CommandError(kUsage, "Name the user whose contacts you want.");
+    const bool isLocation = named.find(':') != std::string::npos || named.find('/') != std::string::npos;
+    if (!isLocation) return baseOf(named);
+    std::string text = named;
+    while (text.ends_with('/')) text.pop_back();
+    const RemoteLocation location(text);
+    if (syncSourceForRemoteLocation(location) != CXDSyncSourceVaultra)
+        throw CommandError(kUsage, fmt::format("\"{}\" is no location of a store. Give the user's name, or a location "
+                                               "like {}.",
+                                               named, baseOf("alice").str()));
+    const std::string user = publisherOf(location);
+    if (user.empty() || baseOf(user) != location)
+        throw CommandError(kNotFound, fmt::format("{} is not on the store of your account, where locations are like "
+                                                  "{}. Give the user's name instead.",
+                                                  named, baseOf(user.empty() ? "alice" : user).str()));
+    return location;
+}
+
+bool mayBeRead(const RemoteLocation& location) {
+    int code = 0;
+    const Url info = Url(location.str()).cxURLByAppendingComponent(layout::kInfo);
+    return CXDAVManager::defaultManager().dictionaryAtURL(info, false, &code).has_value();
 }
 
 std::string ownerMark(const CXListing& listing) {

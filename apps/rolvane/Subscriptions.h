@@ -15,6 +15,12 @@ namespace rolvane::cli {
 // The name of the user who publishes at the location; "" for "", the owner's own.
 std::string publisherOf(const RemoteLocation& location);
 
+// The location that a user's name or a location names on the account's store, as the daemon asks for it. Throws
+// CommandError when it can be none.
+RemoteLocation namedLocation(const std::string& named);
+// Does the store let the account read what is published there?
+bool mayBeRead(const RemoteLocation& location);
+
 // "  [bob]" behind a record of bob's in a list, "" behind the owner's own.
 std::string ownerMark(const CXListing& listing);
 

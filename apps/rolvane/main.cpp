@@ -79,7 +79,9 @@ int main(int argc, char** argv) {
     addGroupCommands(app, context);
     addAccountCommands(app, context);
     addSharingCommands(app, context);
+    addShareCommands(app, context);
     addSubscriptionCommands(app, context);
+    addWithdrawnCommands(app, context);
     addDaemonCommands(app, context);
     addPreferencesCommands(app, context);
     addStoreCommands(app, context);

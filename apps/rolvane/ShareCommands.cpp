@@ -1,0 +1,253 @@
+#include "Context.h"
+#include "Passes.h"
+#include "Publication.h"
+#include "Shares.h"
+#include "Subscriptions.h"
+
+#include "acl/CXDAVACLManager.h"
+#include "daemon/DaemonControl.h"
+#include "model/CXDChangeRecord.h"
+#include "model/RemoteLocationMap.h"
+#include "store/CXDAVManager.h"
+
+#include <algorithm>
+#include <fmt/format.h>
+
+namespace rolvane::cli {
+
+namespace {
+
+using Json = nlohmann::ordered_json;
+
+constexpr const char* kAllACLChanged = "CXAllACLChanged";
+
+struct ShareOptions {
+    std::string user;
+    bool write = false, noWait = false, noDaemon = false;
+    double timeout = kPassSeconds;
+};
+
+// What the store itself says of the owner's tree.
+struct StoreLists {
+    std::vector<std::string> readers, writers;
+    static bool in(const std::vector<std::string>& list, const std::string& user) {
+        return std::find(list.begin(), list.end(), user) != list.end();
+    }
+    const char* rightsOf(const std::string& user) const {
+        return in(writers, user) ? "write" : in(readers, user) ? "read" : nullptr;
+    }
+};
+
+std::optional<StoreLists> storeLists(const Url& base) {
+    StoreLists lists;
+    if (!CXDAVManager::defaultManager().ACLsAtURL(base, lists.readers, lists.writers)) return std::nullopt;
+    return lists;
+}
+
+const char* rightsHere(const Shares& shares, const std::string& user) {
+    return shares.mayWrite(user) ? "write" : shares.mayRead(user) ? "read" : nullptr;
+}
+
+bool same(const char* a, const char* b) {
+    return a && b ? std::string_view(a) == b : a == b;
+}
+
+Json orNull(const char* text) {
+    return text ? Json(text) : Json();
+}
+
+// Refuses where the store cannot do what is asked.
+void requireAccessLists(const Url& base, const std::string& user) {
+    CXDAVError error;
+    if (!CXDAVManager::canReachOstrelError(error))
+        throw CommandError(error.code == kCXDAVErrorAuthentication ? kRefused : kUnreachable,
+                           error.reason + " Nothing was changed.");
+    const auto keeps = CXDAVManager::defaultManager().keepsAccessLists();
+    if (!keeps)
+        throw CommandError(kUnreachable, "The store does not say whether it keeps access lists. Nothing was changed; "
+                                         "try again later.");
+    if (*keeps) return;
+    const auto place = CXDAVManager::defaultManager().account().endpointFor(base, true);
+    throw CommandError(kFailed, fmt::format("The store keeps no access lists (RFC 3744), so nothing was changed: who "
+                                            "may read is written in the server's own configuration. Ask its "
+                                            "administrator to let \"{}\" read {}, or to load mod_davacl.",
+                                            user, place ? place->absoluteString() : base.absoluteString()));
+}
+
+std::string checkedUser(const std::string& user) {
+    const std::string self = CXDAVManager::vaultraUser();
+    if (user.empty()) throw CommandError(kUsage, "Name the user.");
+    if (userForRemoteLocation(
+            RemoteLocation(CXDAVManager::ostrelBaseLocationForOstrelUser(UserName(user)).absoluteString()),
+            UserName(self), {}) == kSelf)
+        throw CommandError(kRefused, fmt::format("\"{}\" is your own account, which may do everything.", user));
+    return user;
+}
+
+// Has the daemon carry the lists to the store, and tells whether they are there. What a writer changed is taken only by
+// a daemon that knew of a writer when it started.
+void carry(Context& context, PassWatch& watch, bool writersCameOrWent, const ShareOptions& options, const Url& base) {
+    CXRolvane& database = context.database();
+    const int64_t position = database.journalPosition();
+    const Date saved = Clock::system().now();
+    const DaemonControl daemon;
+    if (!daemon.running())
+        daemon.start();
+    else if (writersCameOrWent || !context.bus().post({kAllACLChanged, std::nullopt, {}}))
+        daemon.restart();
+    if (options.noWait) return;
+    waitForPass(context, watch, "Sharing", position, saved, options.timeout);
+    const Shares shares(database);
+    const auto agrees = [&] {
+        const auto lists = storeLists(base);
+        return lists && same(lists->rightsOf(options.user), rightsHere(shares, options.user));
+    };
+    if (agrees()) return context.say("The store has it.");
+    CXDAVError error;
+    if (context.bus().connected() && CXDAVManager::canReachOstrelError(error)) makePass(context, options.timeout);
+    if (agrees()) return context.say("The store has it.");
+    const bool reachable = CXDAVManager::canReachOstrelError(error);
+    throw CommandError(reachable ? kFailed : kUnreachable,
+                       reachable ? fmt::format("The store did not take it. Perhaps it knows no user \"{0}\": check the "
+                                               "name, and take it back with `rolvane unshare {0}`.",
+                                               options.user)
+                                 : error.reason + " The store learns of it when it can be reached again.");
+}
+
+void changeShares(Context& context, const ShareOptions& options, bool grant) {
+    const Url base = ownBase();
+    const std::string user = checkedUser(options.user);
+    CXRolvane& database = context.database();
+    Shares shares(database);
+    if (grant && !Publication(database).anything())
+        throw CommandError(kRefused, "Nothing is published yet, so there is nothing to share. `rolvane publish` comes "
+                                     "first.");
+    if (!grant && !shares.mayRead(user)) {
+        const auto lists = Publication(database).anything() ? storeLists(base) : std::nullopt;
+        if (!lists || !lists->rightsOf(user))
+            throw CommandError(kNotFound, fmt::format("You do not share with \"{}\". `rolvane shares` lists with whom "
+                                                      "you do.",
+                                                      user));
+    }
+    requireAccessLists(base, user);
+
+    PassWatch watch(context);
+    const bool hadWriters = !shares.writers().empty();
+    const bool changed = grant ? shares.grant(user, options.write) : shares.deny(user);
+    database.save();
+    const bool hasWriters = !shares.writers().empty();
+    context.say(!grant          ? fmt::format("\"{}\" may no longer read your contacts.", user)
+                : options.write ? fmt::format("\"{}\" may read and change your contacts.", user)
+                                : fmt::format("\"{}\" may read your contacts, not change them.", user));
+    if (!options.noDaemon && (changed || !options.noWait))
+        carry(context, watch, hadWriters != hasWriters, {user, options.write, options.noWait, false, options.timeout},
+              base);
+    if (context.json) context.print({{"user", user}, {"rights", orNull(rightsHere(shares, user))}});
+}
+
+// shares -----------------------------------------------------------------------------------------------------------
+
+void listShares(Context& context) {
+    const Url base = ownBase();
+    const Shares shares(context.database());
+    const auto lists = storeLists(base);
+    std::vector<std::string> users = shares.readers();
+    if (lists)
+        for (const auto* list : {&lists->readers, &lists->writers})
+            for (const std::string& user : *list)
+                if (!StoreLists::in(users, user)) users.push_back(user);
+    Json all = Json::array();
+    for (const std::string& user : users) {
+        const char *here = rightsHere(shares, user), *there = lists ? lists->rightsOf(user) : nullptr;
+        all.push_back({{"user", user},
+                       {"rights", orNull(here)},
+                       {"store", orNull(there)},
+                       {"agrees", lists ? Json(same(here, there)) : Json()}});
+    }
+    if (context.json) return context.print(all);
+    if (all.empty()) context.say("You share with nobody. `rolvane share USER` changes that.");
+    const auto words = [](const Json& rights) {
+        return rights.is_null() ? "nothing" : rights == "write" ? "read and write" : "read";
+    };
+    for (const Json& share : all)
+        context.line(fmt::format("{}  {}{}", share["user"].get<std::string>(), words(share["rights"]),
+                                 share["agrees"].is_null() ? "  (the store does not tell)"
+                                 : share["agrees"]         ? ""
+                                                           : fmt::format("  (the store: {})", words(share["store"]))));
+}
+
+// rights -----------------------------------------------------------------------------------------------------------
+
+class AccountOwner : public LocationOwner {
+public:
+    UserName userForRemoteLocation(const RemoteLocation& location) const override {
+        return rolvane::userForRemoteLocation(location, UserName(CXDAVManager::vaultraUser()), {}).value_or(UserName());
+    }
+};
+
+void showRights(Context& context, const std::string& named) {
+    (void)ownBase();
+    const RemoteLocation location = namedLocation(named);
+    const std::string user = publisherOf(location);
+    CXDAVError error;
+    if (!CXDAVManager::canReachOstrelError(error))
+        throw CommandError(error.code == kCXDAVErrorAuthentication ? kRefused : kUnreachable, error.reason);
+    const AccountOwner owner;
+    bool read = false, write = false;
+    const bool own = owner.userForRemoteLocation(location) == kSelf;
+    const bool lists = CXDAVManager::defaultManager().keepsAccessLists().value_or(false);
+    if (own) {
+        read = write = true;
+    } else {
+        read = mayBeRead(location);
+        if (read && lists) {
+            const CXDAVACLManager manager(Url(location.str()), owner, CXDAVManager::defaultManager());
+            const auto& writers = manager.principalsWithAllAccess();
+            write = std::find(writers.begin(), writers.end(), kSelf) != writers.end();
+        }
+    }
+    const CXSubscriptionRef subscription = context.database().findSubscriptionWithRemoteLocation(location);
+    const Json data{{"user", user},
+                    {"location", location.str()},
+                    {"read", read},
+                    {"write", own || lists ? Json(write) : Json()},
+                    {"subscribed", subscription != nullptr}};
+    if (context.json) return context.print(data);
+    context.line(
+        fmt::format("{}  {}{}", user, read ? (write ? "read and write" : "read") : "nothing",
+                    read && !own && !lists ? "  (the store keeps no access lists: copies are read only)" : ""));
+    if (subscription && subscription->isWritable() != write)
+        context.say(fmt::format("The last pass found otherwise; `rolvane sync` takes it in."));
+}
+
+} // namespace
+
+void addShareCommands(CLI::App& app, Context& context) {
+    const auto o = std::make_shared<ShareOptions>();
+    const auto common = [o](CLI::App& command) {
+        command.add_option("user", o->user, "User name on the store")->required();
+        command.add_flag("--no-wait", o->noWait, "Return as soon as the daemon is at work");
+        command.add_flag("--no-daemon", o->noDaemon, "Only note it; do not start the daemon");
+        command.add_option("--timeout", o->timeout, "Seconds to wait for the pass")
+            ->check(CLI::PositiveNumber)
+            ->capture_default_str();
+    };
+    addCommand(
+        app, context, "share", "Let another user of the store read what you publish, or change it, too",
+        [&](CLI::App& command) {
+            common(command);
+            command.add_flag("--write", o->write, "Changes are allowed; without it reading only");
+        },
+        [&context, o] { changeShares(context, *o, true); });
+    addCommand(app, context, "unshare", "Take a user's rights back", common,
+               [&context, o] { changeShares(context, *o, false); });
+    addCommand(app, context, "shares", "List who may read and who may write, and whether the store agrees", nullptr,
+               [&context] { listShares(context); });
+    const auto named = std::make_shared<std::string>();
+    addCommand(
+        app, context, "rights", "Tell what you may do with another user's contacts",
+        [&](CLI::App& command) { command.add_option("user", *named, "User name or location")->required(); },
+        [&context, named] { showRights(context, *named); });
+}
+
+} // namespace rolvane::cli

@@ -1,0 +1,36 @@
+#pragma once
+
+#include "contacts/CXRolvane.h"
+
+#include <string>
+#include <vector>
+
+namespace rolvane::cli {
+
+// With whom the owner shares, in the contact database: kCXReadSharingACLProperty of the all-contacts group names those
+// who may read, kCXReadWriteSharingACLProperty those of them who may write, too. The daemon carries both to the store.
+//
+// While only single groups are published nothing is carried for the all-contacts group, so each published group has the
+// same two properties then.
+class Shares {
+public:
+    explicit Shares(CXRolvane& database) : _database(database) {}
+
+    std::vector<std::string> readers() const; // writers among them, in the order in which they were granted
+    std::vector<std::string> writers() const;
+    bool mayRead(const std::string& user) const;
+    bool mayWrite(const std::string& user) const;
+
+    // Each is unsaved. True when it changed something.
+    bool grant(const std::string& user, bool write); // without `write` a writer becomes a reader
+    bool deny(const std::string& user);
+    // The two properties on every published group, where they are wanted there.
+    void settle();
+
+private:
+    std::vector<std::string> listed(const char* property) const;
+    bool put(const char* property, const std::string& user, bool wanted);
+    CXRolvane& _database;
+};
+
+} // namespace rolvane::cli

@@ -1,0 +1,92 @@
+#include "Context.h"
+#include "ImportReport.h"
+#include "Withdrawn.h"
+
+#include "contacts/WithdrawnContacts.h"
+
+#include <fmt/format.h>
+
+namespace rolvane::cli {
+
+namespace {
+
+using Json = nlohmann::ordered_json;
+
+// What a person means: the name of a record, or a user of whom there is one.
+WithdrawnContacts findWithdrawn(const std::string& named) {
+    std::vector<WithdrawnContacts> found;
+    for (const WithdrawnContacts& record : WithdrawnContactsFolder().list()) {
+        if (record.name == named || record.file == named) return record;
+        if (record.user.str() == named) found.push_back(record);
+    }
+    if (found.size() == 1) return found.front();
+    if (found.empty())
+        throw CommandError(kNotFound,
+                           fmt::format("Nothing is kept of \"{}\". `rolvane withdrawn list` lists what is.", named));
+    std::string list;
+    for (const WithdrawnContacts& record : found) list += "\n  " + record.name;
+    throw CommandError(kNotFound,
+                       fmt::format("\"{}\" withdrew {} times. Name one of them:{}", named, found.size(), list));
+}
+
+void listWithdrawn(Context& context) {
+    const Json all = withdrawnJson();
+    if (context.json) return context.print(all);
+    if (all.empty()) context.say("Nobody has withdrawn contacts from you.");
+    for (const Json& record : all)
+        context.line(fmt::format("{}  {}", record["name"].get<std::string>(), withdrawnText(record)));
+}
+
+void importWithdrawn(Context& context, const std::string& named) {
+    const WithdrawnContacts record = findWithdrawn(named);
+    if (record.file.empty())
+        throw CommandError(kNotFound, fmt::format("There was nothing to keep when {} withdrew.", record.user.str()));
+    reportImport(context, VCardImport::importFile(context.database(), record.file), 0);
+}
+
+void forgetWithdrawn(Context& context, const std::string& named) {
+    const WithdrawnContacts record = findWithdrawn(named);
+    WithdrawnContactsFolder().forget(record);
+    context.say(fmt::format("{} is forgotten, with {} people.", record.name, record.people));
+}
+
+} // namespace
+
+Json withdrawnJson() {
+    Json all = Json::array();
+    for (const WithdrawnContacts& record : WithdrawnContactsFolder().list())
+        all.push_back({{"name", record.name},
+                       {"user", record.user.str()},
+                       {"location", record.location.str()},
+                       {"date", record.date.toISO8601()},
+                       {"people", record.people},
+                       {"groups", record.groups},
+                       {"file", record.file.empty() ? Json() : Json(record.file)}});
+    return all;
+}
+
+std::string withdrawnText(const Json& record) {
+    const size_t people = record["people"], groups = record["groups"];
+    return fmt::format("{}'s, {} {} and {} group{}, on {}{}", record["user"].get<std::string>(), people,
+                       people == 1 ? "person" : "people", groups, groups == 1 ? "" : "s",
+                       record["date"].get<std::string>(),
+                       record["file"].is_null() ? "" : ", kept in " + record["file"].get<std::string>());
+}
+
+void addWithdrawnCommands(CLI::App& app, Context& context) {
+    CLI::App* withdrawn = addCommand(
+        app, context, "withdrawn", "Contacts that their publisher no longer shares: list, take back", nullptr, nullptr);
+    withdrawn->require_subcommand(1);
+    const auto named = std::make_shared<std::string>();
+    const auto name = [named](CLI::App& command) {
+        command.add_option("name", *named, "Name in the list, or the publisher's")->required();
+    };
+    addCommand(*withdrawn, context, "list", "List whose left, when, how many, and where they are kept", nullptr,
+               [&context] { listWithdrawn(context); });
+    addCommand(*withdrawn, context, "import", "Take kept contacts as your own", name,
+               [&context, named] { importWithdrawn(context, *named); });
+    addCommand(*withdrawn, context, "forget", "Delete what is kept", name,
+               [&context, named] { forgetWithdrawn(context, *named); });
+}
+
+} // namespace rolvane::cli
