@@ -106,6 +106,26 @@ std::unique_ptr<ChildProcess> DaemonWorld::serving(std::vector<std::string> argu
     return daemon;
 }
 
+std::string DaemonWorld::groupDifferences(const CXGroup& group) {
+    const std::string uid = cxNormalizedUID(group.uniqueId()).str();
+    if (!tree().contains(uid)) return uid + " is not on the store\n";
+    const Dictionary state = PropertyList::fromXML(readFile(treeDirectory() + "/" + uid)).dictionary();
+    std::string found;
+    if (state[kCXGroupNameProperty].string() != group.name())
+        found += uid + " is called " + state[kCXGroupNameProperty].string() + " there\n";
+    const auto compare = [&](const char* key, const std::vector<UniqueId>& expected) {
+        std::set<std::string> here, there;
+        for (const UniqueId& each : expected) here.insert(cxNormalizedUID(each).str());
+        for (const Value& each : state[key].array()) there.insert(each.string());
+        if (here != there || there.size() != state[key].array().count())
+            found += fmt::format("{}: {} has {} entries instead of {}, or others\n", uid, key,
+                                 state[key].array().count(), here.size());
+    };
+    compare("memberUIDState", group.memberUniqueIds());
+    compare("subgroupUIDState", group.subgroupUniqueIds());
+    return found;
+}
+
 std::string DaemonWorld::differences() {
     std::string found;
     const Url base = _account.baseLocationFor(_account.user);
@@ -137,6 +157,7 @@ std::string DaemonWorld::differences() {
         found += fmt::format("{} members instead of {}\n", listed.count(), members.count());
     for (const Value& member : members)
         if (!listed.contains(member)) found += member.string() + " is not listed as a member\n";
+    for (const CXGroupRef& group : database().allGroup()->subgroups()) found += groupDifferences(*group);
     return found;
 }
 

@@ -51,6 +51,7 @@ public:
     std::string differences();
 
 private:
+    std::string groupDifferences(const CXGroup& group);
     std::unique_ptr<CXRolvane> _database;
     CXDAVAccount _account;
 };
