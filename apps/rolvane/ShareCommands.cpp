@@ -84,17 +84,12 @@ std::string checkedUser(const std::string& user) {
     return user;
 }
 
-// Has the daemon carry the lists to the store, and tells whether they are there. What a writer changed is taken only by
-// a daemon that knew of a writer when it started.
-void carry(Context& context, PassWatch& watch, bool writersCameOrWent, const ShareOptions& options, const Url& base) {
+// Has the daemon carry the lists to the store, and tells whether they are there.
+void carry(Context& context, PassWatch& watch, const ShareOptions& options, const Url& base) {
     CXRolvane& database = context.database();
     const int64_t position = database.journalPosition();
     const Date saved = Clock::system().now();
-    const DaemonControl daemon;
-    if (!daemon.running())
-        daemon.start();
-    else if (writersCameOrWent || !context.bus().post({kAllACLChanged, std::nullopt, {}}))
-        daemon.restart();
+    if (!DaemonControl().start()) context.bus().post({kAllACLChanged, std::nullopt, {}});
     if (options.noWait) return;
     waitForPass(context, watch, "Sharing", position, saved, options.timeout);
     const Shares shares(database);
@@ -133,15 +128,26 @@ void changeShares(Context& context, const ShareOptions& options, bool grant) {
 
     PassWatch watch(context);
     const bool hadWriters = !shares.writers().empty();
-    const bool changed = grant ? shares.grant(user, options.write) : shares.deny(user);
-    database.save();
-    const bool hasWriters = !shares.writers().empty();
+    grant ? shares.grant(user, options.write) : shares.deny(user);
+    // What writers send is taken only by a daemon that knew of one when it started, and without a bus none hears of the
+    // change. It rests before the lists are saved: ended later, it would be in the middle of carrying them.
+    if (hadWriters == shares.writers().empty() || !context.bus().connected()) {
+        const DaemonControl daemon;
+        const bool ran = daemon.stop();
+        try {
+            database.save();
+        } catch (const CXException&) {
+            if (ran) daemon.start();
+            throw;
+        }
+        if (ran && options.noDaemon) daemon.start();
+    } else {
+        database.save();
+    }
     context.say(!grant          ? fmt::format("\"{}\" may no longer read your contacts.", user)
                 : options.write ? fmt::format("\"{}\" may read and change your contacts.", user)
                                 : fmt::format("\"{}\" may read your contacts, not change them.", user));
-    if (!options.noDaemon && (changed || !options.noWait))
-        carry(context, watch, hadWriters != hasWriters, {user, options.write, options.noWait, false, options.timeout},
-              base);
+    if (!options.noDaemon) carry(context, watch, options, base);
     if (context.json) context.print({{"user", user}, {"rights", orNull(rightsHere(shares, user))}});
 }
 

@@ -1,0 +1,78 @@
+#include "Neighbour.h"
+
+#include <filesystem>
+
+namespace rolvane::test {
+
+namespace {
+
+constexpr std::pair<const char*, const char*> kDirectories[] = {{"XDG_DATA_HOME", "data"},
+                                                                {"XDG_STATE_HOME", "state"},
+                                                                {"XDG_CACHE_HOME", "cache"},
+                                                                {"XDG_CONFIG_HOME", "config"},
+                                                                {"XDG_RUNTIME_DIR", "runtime"}};
+
+} // namespace
+
+Neighbour::Neighbour(CommandWorld& world, const std::string& name, bool withBus) : user(name), _world(world) {
+    for (const auto& [variable, directory] : kDirectories) {
+        std::filesystem::create_directory(_home / directory);
+        std::filesystem::permissions(_home / directory, std::filesystem::perms::owner_all);
+    }
+    if (withBus) _bus = std::make_unique<PrivateBus>();
+    world.store().addUser(user, UserWorld::kPassword);
+    const Ran made = rolvane({"account", "set", "--user", user, "--endpoint", world.store().endpointTemplate(),
+                              "--ca-file", world.store().caFile(), "--ask-password"},
+                             std::string(UserWorld::kPassword) + "\n");
+    EXPECT_EQ(made.status, kDone) << made;
+}
+
+Neighbour::~Neighbour() {
+    (void)rolvane({"daemon", "stop"});
+}
+
+std::vector<std::string> Neighbour::environment() const {
+    std::vector<std::string> variables = _world.home.environment();
+    std::erase_if(variables, [](const std::string& variable) {
+        return variable.starts_with("XDG_") || variable.starts_with("HOME=") || variable.starts_with("DBUS_");
+    });
+    variables.push_back("HOME=" + _home.path());
+    for (const auto& [variable, directory] : kDirectories)
+        variables.push_back(std::string(variable) + "=" + _home / directory);
+    if (_bus) variables.push_back("DBUS_SESSION_BUS_ADDRESS=" + _bus->address());
+    return variables;
+}
+
+Ran Neighbour::rolvane(std::vector<std::string> arguments, const std::string& input) {
+    arguments.insert(arguments.begin(), UserWorld::rolvaneProgram());
+    ChildProcess child({.arguments = std::move(arguments), .environment = environment(), .input = input});
+    if (input.empty()) child.closeInput();
+    constexpr double kSeconds = 60;
+    const auto ending = child.wait(kSeconds);
+    if (!ending) child.kill();
+    const int status = !ending ? -1 : ending->signal ? 128 + ending->signal : ending->status;
+    return {status, child.output(), child.errors()};
+}
+
+std::string Neighbour::done(std::vector<std::string> arguments) {
+    const Ran ran = rolvane(std::move(arguments));
+    EXPECT_EQ(ran.status, kDone) << ran;
+    return ran.output;
+}
+
+nlohmann::json Neighbour::json(std::vector<std::string> arguments, int status) {
+    arguments.push_back("--json");
+    const Ran ran = rolvane(std::move(arguments));
+    EXPECT_EQ(ran.status, status) << ran;
+    nlohmann::json data = nlohmann::json::parse(ran.output, nullptr, false);
+    EXPECT_FALSE(data.is_discarded()) << "no JSON document: " << ran;
+    return data;
+}
+
+std::optional<pid_t> Neighbour::daemon() {
+    const Ran ran = rolvane({"daemon", "status", "--json"});
+    const auto data = nlohmann::json::parse(ran.output, nullptr, false);
+    return data.is_discarded() || data["process"].is_null() ? std::nullopt : std::optional<pid_t>(data["process"]);
+}
+
+} // namespace rolvane::test

@@ -1,0 +1,32 @@
+#pragma once
+
+#include "CommandWorld.h"
+
+namespace rolvane::test {
+
+// Another person on the store of a world, with a home, a session bus and a daemon of their own. At the end the daemon
+// is gone. Used by one thread.
+class Neighbour {
+public:
+    // Signs up at the world's store.
+    Neighbour(CommandWorld& world, const std::string& user, bool withBus = true);
+    ~Neighbour();
+    Neighbour(const Neighbour&) = delete;
+    Neighbour& operator=(const Neighbour&) = delete;
+
+    Ran rolvane(std::vector<std::string> arguments, const std::string& input = {});
+    std::string done(std::vector<std::string> arguments); // it has to end with 0
+    nlohmann::json json(std::vector<std::string> arguments, int status = kDone);
+    std::optional<pid_t> daemon();
+
+    const std::string user;
+
+private:
+    std::vector<std::string> environment() const;
+
+    CommandWorld& _world;
+    TempDirectory _home;
+    std::unique_ptr<PrivateBus> _bus;
+};
+
+} // namespace rolvane::test

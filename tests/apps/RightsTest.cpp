@@ -1,0 +1,136 @@
+#include "Neighbour.h"
+
+namespace rolvane::test {
+namespace {
+
+class Rights : public testing::Test {
+protected:
+    Rights() {
+        world.bus();
+        world.makeAccount();
+        world.add("Ada");
+        world.add("Bea");
+        world.group("Family", {"Ada"});
+    }
+    static nlohmann::json share(const char* user, const char* rights) {
+        return {{"user", user}, {"rights", rights}, {"store", rights}, {"agrees", true}};
+    }
+    CommandWorld world;
+    Neighbour bob{world, "bob"};
+};
+
+TEST_F(Rights, AreGrantedLoweredAndTakenBackAndTheStoreHasThemWhenTheCommandReturns) {
+    world.done({"publish"});
+    EXPECT_EQ(world.json({"shares"}), nlohmann::json::array());
+    EXPECT_EQ(world.json({"share", "bob"}), (nlohmann::json{{"user", "bob"}, {"rights", "read"}}));
+    EXPECT_EQ(world.json({"shares"}), nlohmann::json::array({share("bob", "read")}));
+    EXPECT_EQ(bob.json({"rights", "alice"})["read"], true);
+    EXPECT_EQ(bob.json({"rights", "alice"})["write"], false);
+    world.done({"share", "bob", "--write"});
+    EXPECT_EQ(world.json({"shares"}), nlohmann::json::array({share("bob", "write")}));
+    EXPECT_EQ(bob.json({"rights", "alice"})["write"], true);
+    world.done({"share", "bob"});
+    EXPECT_EQ(world.json({"shares"}), nlohmann::json::array({share("bob", "read")}));
+    EXPECT_EQ(bob.json({"rights", "alice"})["write"], false);
+    world.done({"unshare", "bob"});
+    EXPECT_EQ(world.json({"shares"}), nlohmann::json::array());
+    EXPECT_EQ(bob.json({"rights", "alice"})["read"], false);
+    EXPECT_EQ(bob.done({"rights", "bob"}), "bob  read and write\n");
+}
+
+TEST_F(Rights, TheDaemonStartsAnewForTheFirstWriterAndTheLastOnly) {
+    Neighbour carol(world, "carol");
+    world.done({"publish"});
+    const auto first = world.daemon();
+    ASSERT_TRUE(first);
+    world.done({"share", "bob"});
+    EXPECT_EQ(world.daemon(), first) << "it is told of readers";
+    world.done({"share", "bob", "--write"});
+    const auto second = world.daemon();
+    EXPECT_NE(second, first) << "what writers send is taken by a daemon that knew of one when it started";
+    world.done({"share", "carol", "--write"});
+    EXPECT_EQ(world.daemon(), second);
+    world.done({"unshare", "carol"});
+    EXPECT_EQ(world.daemon(), second);
+    world.done({"unshare", "bob"});
+    EXPECT_NE(world.daemon(), second);
+}
+
+TEST_F(Rights, APublishedGroupIsSharedToo) {
+    world.done({"publish", "--group", "Family"});
+    world.done({"share", "bob"});
+    EXPECT_EQ(world.json({"shares"}), nlohmann::json::array({share("bob", "read")}));
+    bob.done({"subscribe", "alice"});
+    const auto people = bob.json({"list", "--of", "alice"});
+    ASSERT_EQ(people.size(), 1U);
+    EXPECT_EQ(people[0]["name"], "Ada");
+    world.done({"unshare", "bob"});
+    EXPECT_EQ(bob.json({"rights", "alice"})["read"], false);
+}
+
+TEST_F(Rights, BeforeAnythingIsPublishedThereIsNothingToShare) {
+    EXPECT_TRUE(saysOnce(world.rolvane({"share", "bob"}), kNotAllowed, "`rolvane publish` comes first"));
+    EXPECT_EQ(world.json({"shares"}), nlohmann::json::array());
+}
+
+TEST_F(Rights, TheOwnersRightsAreNotUpForChange) {
+    world.done({"publish"});
+    EXPECT_TRUE(saysOnce(world.rolvane({"share", "alice"}), kNotAllowed, "your own account"));
+    EXPECT_TRUE(saysOnce(world.rolvane({"unshare", "Alice"}), kNotAllowed, "your own account"));
+}
+
+TEST_F(Rights, OfSomebodyWhoHasNoneCannotBeTakenBack) {
+    world.done({"publish"});
+    EXPECT_TRUE(saysOnce(world.rolvane({"unshare", "bob"}), kNoSuchThing, "do not share with \"bob\""));
+}
+
+TEST_F(Rights, OfAUserWhomTheStoreDoesNotKnowTheOwnerLearns) {
+    world.done({"publish"});
+    const Ran ran = world.rolvane({"share", "bobb"});
+    EXPECT_EQ(ran.status, kFailure) << ran;
+    EXPECT_NE(ran.errors.find("knows no user \"bobb\""), std::string::npos) << ran;
+    const auto shares = world.json({"shares"});
+    ASSERT_EQ(shares.size(), 1U);
+    EXPECT_EQ(shares[0]["agrees"], false);
+    EXPECT_EQ(world.rolvane({"unshare", "bobb"}).status, kDone);
+    EXPECT_EQ(world.json({"shares"}), nlohmann::json::array());
+}
+
+TEST_F(Rights, WhileTheStoreIsAwayNothingIsChanged) {
+    world.done({"publish"});
+    world.store().stop(PrivateStore::Stop::atOnce);
+    EXPECT_TRUE(saysOnce(world.rolvane({"share", "bob"}), kNotReached, "Nothing was changed"));
+    EXPECT_TRUE(saysOnce(bob.rolvane({"rights", "alice"}), kNotReached, ""));
+    world.store().start();
+    EXPECT_EQ(world.json({"shares"}), nlohmann::json::array());
+}
+
+TEST_F(Rights, GoWithThePublication) {
+    world.done({"publish"});
+    world.done({"share", "bob", "--write"});
+    world.done({"unpublish"});
+    world.done({"publish"});
+    EXPECT_EQ(world.json({"shares"}), nlohmann::json::array());
+    EXPECT_EQ(bob.json({"rights", "alice"})["read"], false);
+}
+
+TEST(RightsOnAPlainStore, AreWhatItsAdministratorSaysAndShareTellsSo) {
+    CommandWorld world;
+    PrivateStoreOptions options;
+    options.stateDirectory = world.home / "plain";
+    options.ownsProcess = true;
+    options.accessLists = false;
+    PrivateStore plain(options);
+    plain.addUser("alice", UserWorld::kPassword);
+    plain.start();
+    world.done({"account", "set", "--user", "alice", "--endpoint", plain.endpointTemplate(), "--ca-file",
+                plain.caFile(), "--ask-password"},
+               std::string(UserWorld::kPassword) + "\n");
+    world.add("Ada");
+    world.done({"publish"});
+    EXPECT_TRUE(saysOnce(world.rolvane({"share", "bob"}), kFailure, "keeps no access lists"));
+    EXPECT_EQ(world.json({"shares"}), nlohmann::json::array());
+}
+
+} // namespace
+} // namespace rolvane::test
