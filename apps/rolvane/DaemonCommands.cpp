@@ -57,6 +57,26 @@ Json storeStatus() {
             {"reason", reachable ? Json() : Json(error.reason)}};
 }
 
+Json refusedJson(const Preferences& preferences) {
+    Json all = Json::array();
+    const Array notes = preferences.get(kDaemonDomain, kCXDRefusedChanges).array();
+    for (const Value& value : notes) {
+        const Dictionary note = value.dictionary();
+        all.push_back({{"user", note[kRefusedUser].string()},
+                       {"changes", note[kRefusedChanges].integer()},
+                       {"date", dateOrNull(note[kRefusedDate])}});
+    }
+    return all;
+}
+
+std::string refusedText(const Json& record) {
+    const int64_t changes = record["changes"];
+    const std::string user = record["user"];
+    return fmt::format("{} change{} of {} contacts, on {}: the store does not let you write there", changes,
+                       changes == 1 ? "" : "s", user == kSelf.str() ? "your own" : user + "'s",
+                       record["date"].is_null() ? "an unknown date" : record["date"].get<std::string>());
+}
+
 Json status(Context& context) {
     CXRolvane& database = context.database();
     Preferences& preferences = Preferences::shared();
@@ -76,6 +96,7 @@ Json status(Context& context) {
             {"published", {{"everything", publication.everything()}, {"groups", groups}}},
             {"subscriptions", subscriptions},
             {"withdrawn", withdrawnJson()},
+            {"refused", refusedJson(preferences)},
             {"pending", EngineState(preferences).getPendingChanges().size()},
             {"lastPass", dateOrNull(preferences.get(kDaemonDomain, kCXDCXConduitLastSyncDate))},
             {"lastStorePass", dateOrNull(preferences.get(kDaemonDomain, kCXDVaultraConduitLastSyncDate))}};
@@ -120,6 +141,7 @@ void showStatus(Context& context) {
     row("Published", publishedText(s["published"]));
     row("Subscribed", subscribedText(s["subscriptions"]));
     for (const Json& record : s["withdrawn"]) row("Withdrawn", withdrawnText(record));
+    for (const Json& record : s["refused"]) row("Refused", refusedText(record));
     row("Waiting", fmt::format("{} change{}", pending, pending == 1 ? "" : "s"));
     row("Last pass", s["lastPass"].is_null() ? "never" : s["lastPass"].get<std::string>());
 }

@@ -233,6 +233,7 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
     _queueStored = true;
     const bool lookAgain = noteUnsettled() && _pendingChanges.empty();
     _pendingChanges.clear();
+    if (!_parts.denied.empty()) _parts.state.noteRefusedChanges(_parts.denied.all(), _parts.with.clock.now());
     if (!_parts.denied.empty() || lookAgain) {
         _parts.denied.clear();
         if (allowRetry) _actions.scheduleRetry();

@@ -4,6 +4,7 @@
 #include "foundation/KeyedArchive.h"
 #include "foundation/Log.h"
 
+#include <map>
 #include <utility>
 
 namespace rolvane {
@@ -81,6 +82,17 @@ void EngineState::setPendingChanges(const CXDChangeRecords& records) {
     };
     _preferences.setData(kDaemonDomain, kCXDPendingChanges, KeyedArchive::archive(records.size(), archived));
     _preferences.synchronize(kDaemonDomain);
+}
+
+void EngineState::noteRefusedChanges(const CXDChangeRecords& records, Date when) {
+    constexpr size_t kKept = 20;
+    std::map<std::string, int64_t> byUser;
+    for (const CXDChangeRecordPtr& record : records) ++byUser[record->user().value_or(UserName()).str()];
+    Array notes = _preferences.get(kDaemonDomain, kCXDRefusedChanges).array().mutableCopy();
+    for (const auto& [user, changes] : byUser)
+        notes.append(Dictionary{{kRefusedDate, when}, {kRefusedUser, user}, {kRefusedChanges, changes}});
+    while (notes.count() > kKept) notes.removeAt(0);
+    _preferences.set(kDaemonDomain, kCXDRefusedChanges, notes);
 }
 
 void EngineState::setRemoteLocationForSubscriptionUID(const std::optional<RemoteLocation>& location,

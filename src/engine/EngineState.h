@@ -20,6 +20,11 @@ inline constexpr const char* kCXDCXConduitLastSyncDate = "CXDCXConduitLastSyncDa
 inline constexpr const char* kCXDLocalConduitLastSyncDate = "CXDLocalConduitLastSyncDate";
 inline constexpr const char* kCXDShareCount = "CXDShareCount";
 inline constexpr const char* kCXDLastOstrelUser = "CXDLastOstrelUser";
+// What stores have refused, the latest last, for people to see: an array of dictionaries with these keys.
+inline constexpr const char* kCXDRefusedChanges = "CXDRefusedChanges";
+inline constexpr const char* kRefusedDate = "date";
+inline constexpr const char* kRefusedUser = "user";       // whose contacts they were
+inline constexpr const char* kRefusedChanges = "changes"; // how many
 
 // The engine's memory: the conduit data and the queue, in the daemon's preferences. The conduit data is read on first
 // need and lives in memory until it is dropped. Finding a conduit's dictionary is safe on any thread; the dictionaries
@@ -39,6 +44,9 @@ public:
     // A queue that cannot be read is empty.
     CXDChangeRecords getPendingChanges() const;
     void setPendingChanges(const CXDChangeRecords& records);
+
+    // Adds what a pass was refused; the oldest are forgotten. Without synchronising.
+    void noteRefusedChanges(const CXDChangeRecords& records, Date when);
 
     // Subscription identifier to remote location. Nothing happens when one of the two is missing.
     void setRemoteLocationForSubscriptionUID(const std::optional<RemoteLocation>& location,

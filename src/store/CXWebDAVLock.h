@@ -16,7 +16,9 @@ class CXWebDAVLock {
 public:
     virtual ~CXWebDAVLock() = default;
 
-    virtual bool tryLock() = 0;      // true when held afterwards; does not wait for another holder
+    // True when it is held afterwards, and when the store lets us write nothing there, so that no lock is needed. Does
+    // not wait for another holder.
+    virtual bool tryLock() = 0;
     virtual void unlock() = 0;       // nothing when not held; a failure leaves the lock to expire
     virtual bool renew() = 0;        // false: the lock is lost and no longer held
     virtual bool locked() const = 0; // taken, not released, not known to be lost

@@ -132,5 +132,27 @@ TEST(RightsOnAPlainStore, AreWhatItsAdministratorSaysAndShareTellsSo) {
     EXPECT_EQ(world.json({"shares"}), nlohmann::json::array());
 }
 
+TEST_F(Rights, AnEditThatCameTooLateIsRefusedToldAndLeavesTheQueue) {
+    world.done({"publish"});
+    world.done({"share", "bob", "--write"});
+    bob.done({"subscribe", "alice"});
+    bob.done({"daemon", "stop"}); // the edit waits
+    bob.done({"edit", "Ada", "--note", "too late"});
+    world.done({"share", "bob"});
+    const std::string before = contentsOf(world.published("AllCXGroup"));
+    bob.rolvane({"sync"});
+    EXPECT_EQ(bob.json({"status"})["pending"], 0);
+    const nlohmann::json refused = bob.json({"status"})["refused"];
+    ASSERT_EQ(refused.size(), 1U) << refused;
+    EXPECT_EQ(refused[0]["user"], "alice");
+    EXPECT_GE(refused[0]["changes"], 1);
+    EXPECT_NE(bob.done({"status"}).find("does not let you write"), std::string::npos);
+    EXPECT_EQ(contentsOf(world.published("AllCXGroup")), before);
+    world.done({"sync"});
+    EXPECT_EQ(world.done({"show", "Ada"}).find("too late"), std::string::npos);
+    bob.done({"sync"});
+    EXPECT_EQ(bob.done({"show", "Ada"}).find("too late"), std::string::npos) << "the copy is the publisher's again";
+}
+
 } // namespace
 } // namespace rolvane::test
