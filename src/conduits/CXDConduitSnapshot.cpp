@@ -90,6 +90,7 @@ void CXDConduit::readLocation(const RemoteLocation& location, Dictionary& state)
 }
 
 std::optional<Dictionary> CXDConduit::fetchWorkingStateForSubscription(const Url& base, bool* forbidden) {
+    if (forbidden) *forbidden = false;
     CXFileManager* manager = defaultManager();
     if (!manager) return std::nullopt;
     Dictionary state, people;

@@ -48,7 +48,7 @@ public:
     std::optional<UserName> realUserFromUser(const std::optional<UserName>& user) const override {
         return user == kSelf ? UserName("ada") : user;
     }
-    CXFileManager* defaultManager() const override { return &files; }
+    CXFileManager* defaultManager() const override { return hasFiles ? &files : nullptr; }
     std::optional<Url> baseLocationForUser(const std::optional<UserName>& user) const override {
         if (!user) return std::nullopt;
         return Url("http://store.example/" + Url::percentEncodeComponent(user->str()) + "/Contacts");
@@ -61,6 +61,7 @@ public:
     void setLastSyncDate(std::optional<Date> date) { _lastSyncDate = date; }
 
     mutable MemoryFiles files;
+    bool hasFiles = true;
 
 protected:
     CXRolvane& database() const override { return _database; }
@@ -290,6 +291,35 @@ TEST_F(StoreSnapshot, AStoreThatCannotBeReadHasNoEntryAndNothingIsRevoked) {
     EXPECT_EQ(database.subscriptions().size(), 2u);
 }
 
+TEST_F(StoreSnapshot, TheOwnersTreeThatIsGoneEndsThePublicationAndRemovesNoContact) {
+    publishAll();
+    person("Own", "o");
+    save();
+    engine.priorState("CXDVaultra").set("<self>", Dictionary());
+    EXPECT_TRUE(conduit.currentState().empty());
+    EXPECT_EQ(engine.takeCalls(), Texts{"revoke " + kAda + " -"});
+    EXPECT_FALSE(database.allGroup()->valueForProperty(kCXRemoteLocationProperty));
+    EXPECT_EQ(count(RemoteLocation("")), 1u);
+    EXPECT_FALSE(database.hasUnsavedChanges());
+}
+
+TEST_F(StoreSnapshot, ASourceThatHasNoFilesToReadRevokesNothing) {
+    publish(kBob, {"a:CXPerson"});
+    subscribe();
+    subscribedPerson("Cleo", "c");
+    save();
+    conduit.hasFiles = false;
+    EXPECT_TRUE(conduit.currentState().empty());
+    EXPECT_TRUE(engine.takeCalls().empty());
+    EXPECT_EQ(count(kBobsLocation), 1u);
+}
+
+TEST_F(StoreSnapshot, SynchronisesTheContactApplicationsPreferencesBeforeItReadsTheSubscriptions) {
+    preferences.set(kApplicationDomain, "Mark", 1);
+    conduit.currentState();
+    EXPECT_EQ(Preferences(preferences.path()).get(kApplicationDomain, "Mark"), Value(1));
+}
+
 // -- the comparison of everybody
 
 TEST_F(StoreSnapshot, TheFirstPassOverASubscriptionTakesEverybodyWithTheirContentLeftInTheStore) {
@@ -341,6 +371,21 @@ TEST_F(StoreSnapshot, AnotherSerialNumberGivesNoRecordsAndCancelsTheSharingOnce)
     EXPECT_EQ(engine.takeCalls(), Texts{"revoke " + kBob + " " + subscription->uniqueId().str()});
     EXPECT_EQ(count(kBobsLocation), 0u);
     EXPECT_EQ(database.subscriptions().size(), 1u);
+}
+
+TEST_F(StoreSnapshot, AnotherSerialNumberOfTheOwnersTreeEndsThePublicationAndRemovesNoContact) {
+    publish(kAda, {"a:CXPerson"}, {{"G:CXGroup", {}}});
+    publishAll();
+    person("Own", "o");
+    save();
+    engine.priorState("CXDVaultra").set("<self>", Dictionary{{"SerialNumber", "another"}});
+    EXPECT_TRUE(conduit.changeRecords().empty());
+    EXPECT_EQ(engine.takeCalls(), Texts{"revoke http://store.example/%3Cself%3E/Contacts -"})
+        << "under the user as it stands";
+    EXPECT_EQ(engine.userForRemoteLocation(engine.revoked.front()), kSelf);
+    EXPECT_FALSE(database.allGroup()->valueForProperty(kCXRemoteLocationProperty));
+    EXPECT_EQ(count(RemoteLocation("")), 1u);
+    EXPECT_FALSE(database.hasUnsavedChanges());
 }
 
 TEST_F(StoreSnapshot, AUserOnlyInThePriorStateIsSkipped) {
