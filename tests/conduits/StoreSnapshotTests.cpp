@@ -274,6 +274,7 @@ TEST_F(StoreSnapshot, AForbiddenSubscriptionIsRevokedAndItsCopiesLeaveInOneSave)
     EXPECT_TRUE(conduit.currentState().empty());
     EXPECT_EQ(engine.takeCalls(), Texts{"revoke " + kBob + " " + subscription->uniqueId().str()});
     EXPECT_EQ(count(kBobsLocation), 0u);
+    EXPECT_FALSE(database.recordForUniqueId(UniqueId("G:CXSubscribedGroup")));
     EXPECT_EQ(database.subscriptions().size(), 1u);
     EXPECT_EQ(database.listPeople(RemoteLocation(""), "").size(), 1u) << "the owner's own stay";
     std::set<Date> saves;

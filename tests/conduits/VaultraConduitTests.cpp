@@ -218,6 +218,15 @@ TEST_F(VaultraConduit, ClosingForgetsRevokedUsers) {
     EXPECT_TRUE(engine.priorState("CXDVaultra").empty());
 }
 
+TEST_F(VaultraConduit, ClosingOfflineForgetsRevokedUsersToo) {
+    engine.priorState("CXDVaultra").set("bob", Dictionary());
+    engine.revoked = {RemoteLocation("http://contacts.example.org/bob/Contacts")};
+    network.up = false;
+    conduit->open();
+    conduit->close();
+    EXPECT_TRUE(engine.priorState("CXDVaultra").empty());
+}
+
 TEST_F(VaultraConduit, TheServersDateIsThatOfTheClockFileItHasJustWritten) {
     open();
     ASSERT_TRUE(conduit->currentServerDate());
@@ -258,6 +267,14 @@ TEST_F(VaultraConduit, ASecondRefusalWithin15MinutesShowsNothingAndStillEndsTheD
 
 TEST_F(VaultraConduit, SomebodyElsesPublicationStartsAPass) {
     distributed.post({"SimulateVaultraNotification", std::nullopt, {}});
+    EXPECT_EQ(engine.takeCalls(), Texts{"bringSourcesUpToDate"});
+}
+
+TEST_F(VaultraConduit, ManyPublicationsWhileTheDaemonIsSuspendedStartOnePass) {
+    distributed.setSuspended(true);
+    for (int i = 0; i < 3; ++i) distributed.post({"SimulateVaultraNotification", std::nullopt, {}});
+    EXPECT_TRUE(engine.takeCalls().empty());
+    distributed.setSuspended(false);
     EXPECT_EQ(engine.takeCalls(), Texts{"bringSourcesUpToDate"});
 }
 
@@ -328,6 +345,18 @@ TEST_F(VaultraConduit, ANewGroupGetsADirectoryAndItsInformation) {
     const Dictionary info{{kCXGroupNameProperty, "Friends"}, {"else", 1}};
     EXPECT_TRUE(apply(record(CXDCreateStructureForGroup, nullptr, "G:CXGroup", info)));
     EXPECT_EQ(plist("G:CXGroup/info"), Value(info));
+}
+
+TEST_F(VaultraConduit, WhetherTheDirectoryCouldBeMadeShowsInTheWriteBelowIt) {
+    open();
+    ASSERT_TRUE(apply(record(CXDCreateStructureForGroup, nullptr, "G:CXGroup", Dictionary{{"else", 1}})));
+    answerEvery("MKCOL", 500);
+    const Dictionary info{{kCXGroupNameProperty, "Friends"}};
+    EXPECT_TRUE(apply(record(CXDCreateStructureForGroup, nullptr, "G:CXGroup", info)));
+    EXPECT_EQ(plist("G:CXGroup/info"), Value(info));
+    answerEvery("MKCOL", 403);
+    EXPECT_FALSE(apply(record(CXDCreateStructureForGroup, nullptr, "H:CXGroup", info)));
+    EXPECT_FALSE(denied) << "the write found no directory, and that is tried again";
 }
 
 TEST_F(VaultraConduit, ARenameDropsEveryOtherKeyOfTheInformation) {
