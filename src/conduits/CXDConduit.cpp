@@ -43,8 +43,11 @@ void CXDConduit::close() {
     const auto identifier = conduitID();
     if (!identifier) return;
     Dictionary prior = _engine.conduitObjectForKey(*identifier, kPriorState);
-    for (const RemoteLocation& location : _engine.revokedRemoteLocations())
+    for (const RemoteLocation& location : _engine.revokedRemoteLocations()) {
         prior.remove(_engine.userForRemoteLocation(location).str());
+        // The next subscription to the location starts with the rights that it is given.
+        if (_ACLManagerMap) _ACLManagerMap->erase(location.str());
+    }
 }
 
 CXDChangeRecords CXDConduit::changeRecords() {

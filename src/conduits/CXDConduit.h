@@ -38,7 +38,8 @@ public:
     std::optional<Date> lastSyncDate() const { return _lastSyncDate; }
 
     virtual void open(); // base: nothing
-    // Removes the users of revoked locations from this conduit's prior state. Subclasses persist their last-sync date.
+    // Removes the users of revoked locations from this conduit's prior state, and what was known of their access lists.
+    // Subclasses persist their last-sync date.
     virtual void close();
     // Base: the comparison of prior and current state of a store.
     virtual CXDChangeRecords changeRecords();

@@ -395,6 +395,24 @@ TEST_F(Apply, WriteAccessIsGrantedAndDeniedThroughTheLocationsManager) {
     EXPECT_FALSE(all()->multiValueForProperty(kCXReadWriteSharingACLProperty));
 }
 
+TEST_F(Apply, WhoSubscribesAgainAfterARevocationDoesNotInheritTheRightToWrite) {
+    apply(CXDChangeGroupReadWriteACL, "bob", nullptr, "AllCXGroup", Dictionary{{"additions", Array{"<self>"}}});
+    conduit->saveACLs();
+    ASSERT_TRUE(
+        database.allGroupForRemoteLocation(kBobsLocation)->multiValueForProperty(kCXReadWriteSharingACLProperty));
+    engine.revoked = {kBobsLocation};
+    database.removeRecord(database.findSubscriptionWithRemoteLocation(kBobsLocation));
+    save();
+    conduit->close();
+
+    engine.revoked.clear();
+    subscribe();
+    save();
+    conduit->saveACLs();
+    EXPECT_FALSE(
+        database.allGroupForRemoteLocation(kBobsLocation)->multiValueForProperty(kCXReadWriteSharingACLProperty));
+}
+
 TEST_F(Apply, WhatIsGrantedAndDeniedAtOnceIsDenied) {
     EXPECT_TRUE(apply(CXDChangeGroupReadWriteACL, "bob", nullptr, "AllCXGroup",
                       Dictionary{{"additions", Array{"<self>"}}, {"deletions", Array{"<self>"}}}));
