@@ -174,8 +174,10 @@ void PrivateStore::Implementation::endOrphans() const {
 
 void PrivateStore::Implementation::writeConfiguration(int port) {
     if (options.tls) certificates().ensure(options.hosts, options.certificateLifetime);
-    writeFileDurably(configurationFile(),
-                     renderStoreConfiguration(readFile(storeTemplatePath()), options, port, LoopbackPort::hasIPv6()));
+    writeFileDurably(configurationFile(), renderStoreConfiguration(readFile(options.configurationTemplate.empty()
+                                                                                ? storeTemplatePath()
+                                                                                : options.configurationTemplate),
+                                                                   options, port, LoopbackPort::hasIPv6()));
     writeFileDurably(state + "/conf/users.conf", renderStoreUsers(davDirectory(), passwords().users(),
                                                                   options.authentication, options.keepsAccessLists()));
     writeFileDurably(settingsFile(), PropertyList::toXML(storeOptionsToDictionary(options, port)));

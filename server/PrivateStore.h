@@ -37,6 +37,8 @@ struct PrivateStoreOptions {
     std::chrono::seconds certificateLifetime{std::chrono::hours(24 * 365 * 5)};
     std::string httpdProgram = "/usr/sbin/apache2";
     std::string httpdModules = "/usr/lib/apache2/modules";
+    std::string configurationTemplate; // a file; "" = the one that was built or installed with the program
+    std::string accessModule;          // a file, mod_davacl; "" likewise, else the one among httpdModules
 
     bool keepsAccessLists() const { return accessLists && authentication != StoreAuthentication::none; }
 };

@@ -105,7 +105,9 @@ std::string renderStoreConfiguration(const std::string& templateText, const Priv
     for (const auto& path : {options.stateDirectory, options.documentRoot, options.httpdModules})
         refuseUnsafePath(path);
     refuseUnsafeWord("log level", options.logLevel);
-    const std::string module = options.keepsAccessLists() ? storeAccessModulePath(options.httpdModules) : "/none";
+    const std::string module = !options.keepsAccessLists()    ? "/none"
+                               : options.accessModule.empty() ? storeAccessModulePath(options.httpdModules)
+                                                              : options.accessModule;
     if (module.empty())
         throw CXException(kCXPrivateStoreException,
                           "The store's access lists need mod_davacl.so, which is missing from " +

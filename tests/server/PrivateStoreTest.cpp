@@ -1,10 +1,12 @@
 #include "StoreTestWorld.h"
 #include "foundation/CXException.h"
 #include "foundation/Paths.h"
+#include "server/StoreConfiguration.h"
 
 #include <arpa/inet.h>
 #include <chrono>
 #include <csignal>
+#include <filesystem>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <netinet/in.h>
@@ -529,15 +531,22 @@ TEST(PrivateStore, KeepsKeysAndPasswordsFromOtherUsersWhateverTheUmask) {
 // Root's tests say nothing about ordinary users: a child becomes one and does it all again.
 TEST(PrivateStore, RunsForAnOrdinaryUser) {
     const StoreDirectory directory;
+    PrivateStoreOptions options = optionsIn(directory);
+    // What was built may lie where ordinary users cannot look.
+    options.configurationTemplate = directory.path("httpd.conf.in");
+    options.accessModule = directory.path("mod_davacl.so");
+    std::filesystem::copy_file(storeTemplatePath(), options.configurationTemplate);
+    std::filesystem::copy_file(storeAccessModulePath(options.httpdModules), options.accessModule);
     if (geteuid() == 0) {
-        ASSERT_EQ(chown(directory.path().c_str(), 65534, 65534), 0);
+        for (const std::string& path : {directory.path(), options.configurationTemplate, options.accessModule})
+            ASSERT_EQ(chown(path.c_str(), 65534, 65534), 0);
     }
     const pid_t child = fork();
     if (child == 0) {
         int result = 1;
         if (geteuid() != 0 || (setgid(65534) == 0 && setuid(65534) == 0)) {
             try {
-                PrivateStore store(optionsIn(directory));
+                PrivateStore store(options);
                 store.addUser("alice", "a");
                 store.start();
                 const bool put = CurlClient(store, "alice", "a").request("PUT", "/alice/x", {}, "x").status == 201;
