@@ -135,16 +135,16 @@ StoreFiles::Fetched StoreFiles::fetch(const Url& url, bool mayBeCollection) {
         out.found = Found::perhapsCollection;
     } else if (answer.status == 200) {
         out.version = versionOf(answer);
+        out.isHtml = isHtml(answer);
         out.found = Found::noDictionary;
         try {
             const Value value = PropertyList::fromXML(answer.body, kReadLimits);
             if (const Dictionary* d = value.dictionaryIf()) {
                 out.dictionary = *d;
                 out.found = Found::dictionary;
-            } else
-                CXLog("What lies at %@ is no dictionary and is left out.", url);
+            }
         } catch (const CXException& e) {
-            CXLog("What lies at %@ is no dictionary and is left out: %@", url, e.reason());
+            out.reason = e.reason();
         }
     }
     return out;
@@ -186,8 +186,9 @@ StoreFiles::Fetched StoreFiles::fetchEither(const Url& url, Url& target) {
     return second;
 }
 
-// A group's state that is no dictionary may be replaced, its members with it. So that must not be the answer of a
-// connection that was cut off: only what is read the same way twice counts.
+// A group's state that is no dictionary may be replaced, its members with it, and a contact of that kind is not read
+// again while it stays as it is. So that must not be the answer of a connection that was cut off: only what is read the
+// same way twice counts.
 StoreFiles::Fetched StoreFiles::confirmed(const Fetched& once, const Url& target) {
     Fetched again = fetch(target, false);
     const bool same = again.version.etag == once.version.etag && again.version.size == once.version.size;
@@ -207,7 +208,11 @@ void StoreFiles::note(const Url& name, const Url& target, const Fetched& fetched
         _versions.read(name.absoluteString(), fetched.version);
         if (mayBeBoth(name)) _copies.keep(name.absoluteString(), *fetched.dictionary);
     } else if (fetched.found == Found::noDictionary) {
-        mark.state = ReadMark::State::present; // and its version stays unseen: nobody has learnt what it says
+        CXLog("What lies at %@ is no dictionary and is left out. %@", target, fetched.reason);
+        mark.state = ReadMark::State::present;
+        // Nobody has learnt what a group says, so its version stays unseen. A contact of that kind is left out by
+        // everybody, and reading it in every pass would tell nothing new; a login page tells nothing of the file.
+        if (!mayBeBoth(name) && !fetched.isHtml) _versions.read(name.absoluteString(), fetched.version);
     }
     lastReads[_reader] = std::move(mark);
 }
@@ -220,7 +225,7 @@ StoreFiles::Reading StoreFiles::read(const Url& name, bool securely) {
     if (!url) return {};
     Url target = *url;
     Fetched fetched = mayBeBoth(name) ? fetchEither(*url, target) : fetch(*url, false);
-    if (mayBeBoth(name) && fetched.found == Found::noDictionary) fetched = confirmed(fetched, target);
+    if (fetched.found == Found::noDictionary) fetched = confirmed(fetched, target);
     note(name, target, fetched);
     return {fetched.code, std::move(fetched.dictionary)};
 }
@@ -271,7 +276,7 @@ int StoreFiles::put(const Url& name, const Url& target, const std::shared_ptr<co
         const std::string* tag = answer.header("etag");
         const std::string* date = answer.header("date");
         _versions.wrote(name.absoluteString(), tag ? EntityTag(*tag) : EntityTag(),
-                        date ? Date::fromHTTP(*date) : std::nullopt, body->size());
+                        date ? Date::fromHTTP(*date) : std::nullopt, *body);
         if (mayBeBoth(name)) keepWritten(name, *body);
     }
     return answer.status;

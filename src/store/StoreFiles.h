@@ -51,6 +51,8 @@ private:
         int code = 0;
         std::optional<Dictionary> dictionary;
         FileVersion version;
+        bool isHtml = false; // as its content type has it
+        std::string reason;  // why it is no dictionary
     };
     Fetched fetch(const Url& url, bool mayBeCollection);
     Fetched fetchEither(const Url& url, Url& target);

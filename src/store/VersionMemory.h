@@ -22,16 +22,17 @@ struct FileVersion {
 // Remembers, per URL, the version of each remote file that this client last read or wrote. A cache: a forgotten version
 // costs a read. Bounded: past `capacity` URLs it forgets some. Weak and strong forms of one entity tag are one version.
 // Any thread.
-//   file = "RVM1" seed:u64 (urlHash:u64 kind:u64 value:u64)*   little endian as the machine has it
+//   file = "RVM2" seed:u64 (urlHash:u64 kind:u64 value:u64 digest:u64)*   little endian as the machine has it
 class VersionMemory {
 public:
     // `path` empty: in memory only. A damaged or missing file is an empty memory.
     explicit VersionMemory(std::string path = {}, size_t capacity = 400000);
 
     void read(std::string_view url, const FileVersion& version);
-    // After a write: servers that give no entity tag then are matched by size and their own date, give or take a
-    // second.
-    void wrote(std::string_view url, const EntityTag& etag, std::optional<Date> serverDate, uint64_t size);
+    // After a write. Where the answer to it gave no entity tag, a tag in a later listing that is a SHA-1 digest of the
+    // content (28 characters of base64) tells for certain whose version it is; for other tags, and without any, size
+    // and the server's own date decide, give or take a second.
+    void wrote(std::string_view url, const EntityTag& etag, std::optional<Date> serverDate, std::string_view content);
     void forget(std::string_view url);
     // True when the version in a listing is the one remembered.
     bool knows(std::string_view url, const FileVersion& version);
@@ -44,6 +45,7 @@ private:
     struct Entry {
         Kind kind;
         uint64_t value;
+        uint64_t digest = 0; // of a written version: hash of the tag that would be its digest
     };
     uint64_t hash(std::string_view text) const;
     uint64_t tagHash(const EntityTag& tag) const;

@@ -1,0 +1,87 @@
+// Two people who write to one tree at the same time.
+
+#include "TwoUsers.h"
+
+namespace rolvane::test {
+
+class TwoWriters : public TwoUsers {
+protected:
+    static constexpr size_t kPeople = 50, kGroups = 5;
+
+    CXPersonRef personOf(Participant& user, size_t i) { return &user == &bob ? bob.copyOf(crowd[i]) : crowd[i]; }
+    CXGroupRef groupOf(Participant& user, size_t i) {
+        if (&user == &alice) return circles[i];
+        return std::dynamic_pointer_cast<CXGroup>(
+            bob.application->recordForUniqueId(cxUIDWithTableName(circles[i]->uniqueId(), kCXSubscribedGroupTable)));
+    }
+    void edit(Participant& user, int number, std::mt19937& random) {
+        const size_t who = random() % kPeople;
+        const CXPersonRef person = personOf(user, who);
+        ASSERT_TRUE(person);
+        if (random() % 5 != 0) {
+            const std::string value = user.name + " " + std::to_string(number);
+            written[cxNormalizedUID(person->uniqueId()).str()].insert(value);
+            person->setValue(Value(value), kCXFirstNameProperty);
+        } else {
+            const CXGroupRef group = groupOf(user, random() % kGroups);
+            ASSERT_TRUE(group);
+            if (random() % 2)
+                group->addMember(person);
+            else
+                group->removeMember(person);
+        }
+        user.application->save();
+    }
+
+    std::vector<CXPersonRef> crowd;
+    std::vector<CXGroupRef> circles;
+    std::map<std::string, std::set<std::string>> written; // by contact: every name that somebody gave it
+};
+
+TEST_F(TwoWriters, AfterFiveHundredEditsEachBothDatabasesAndTheStoreAreEqual) {
+    constexpr int kEdits = 500;
+    std::mt19937 random(20260611);
+    for (size_t i = 0; i < kPeople; ++i) crowd.push_back(alice.add("Person " + std::to_string(i)));
+    for (size_t i = 0; i < kGroups; ++i)
+        circles.push_back(alice.group("Circle " + std::to_string(i), {crowd[i * 7], crowd[i * 7 + 1]}));
+    for (const CXPersonRef& each : crowd)
+        written[cxNormalizedUID(each->uniqueId()).str()].insert(firstName(each).string());
+    alice.pass();
+    bob.pass();
+    ASSERT_EQ(copies(), alice.view());
+
+    for (int left[2] = {kEdits, kEdits}; left[0] + left[1] > 0;) {
+        const size_t who = left[0] == 0 ? 1 : left[1] == 0 ? 0 : random() % 2;
+        Participant& user = who == 0 ? alice : bob;
+        edit(user, left[who]--, random);
+        if (random() % 20 == 0) (random() % 2 ? alice : bob).pass();
+    }
+    for (Participant* each : {&alice, &bob, &alice, &bob}) each->pass();
+
+    const auto ours = alice.view(), theirs = copies();
+    ASSERT_EQ(ours.size(), theirs.size());
+    for (const auto& [name, value] : ours)
+        EXPECT_EQ(theirs.contains(name) ? theirs.at(name) : "nothing", value) << name;
+    for (const CXPersonRef& each : crowd) {
+        const std::string uid = cxNormalizedUID(each->uniqueId()).str();
+        EXPECT_EQ(contentOf(fileOf(each))[kCXFirstNameProperty], firstName(each)) << uid;
+        EXPECT_TRUE(written[uid].contains(firstName(each).string())) << uid << " " << firstName(each).string();
+    }
+    for (const CXGroupRef& each : circles) {
+        const std::filesystem::path place = world->file(each->uniqueId().str());
+        const Dictionary state =
+            contentOf(std::filesystem::is_directory(place) ? place / CXDAVManager::kStateName : place);
+        std::set<std::string> here, there;
+        for (const UniqueId& member : each->memberUniqueIds()) here.insert(cxNormalizedUID(member).str());
+        for (const Value& member : state["memberUIDState"].array()) there.insert(member.string());
+        EXPECT_EQ(here, there) << each->name();
+        EXPECT_EQ(state["memberUIDState"].array().count(), there.size()) << "doubled in " << each->name();
+        EXPECT_EQ(each->memberUniqueIds().size(), here.size()) << "doubled in " << each->name();
+    }
+    for (Participant* each : {&alice, &bob}) {
+        EXPECT_TRUE(each->engine->getPendingChanges().empty()) << each->name;
+        expectQuietPass(*each);
+    }
+}
+
+} // namespace rolvane::test
