@@ -193,11 +193,20 @@ TEST(VersionMemory, KnowsWhatWasReadInAnotherRunAndForgetsDamage) {
 
 TEST(VersionMemory, AWriteWithoutATagIsKnownBySizeAndServerDate) {
     VersionMemory m;
-    m.wrote("u", EntityTag(), Date(1000), 5);
+    m.wrote("u", EntityTag(), Date(1000), "hello");
     EXPECT_FALSE(m.knows("u", {EntityTag("\"x\""), Date(1002), 5}));
     EXPECT_FALSE(m.knows("u", {EntityTag("\"x\""), Date(1000), 6}));
     EXPECT_TRUE(m.knows("u", {EntityTag("\"x\""), Date(999), 5}));
     EXPECT_FALSE(m.knows("u", {EntityTag("\"y\""), Date(1000), 5})) << "once its tag is known, only that";
+}
+
+TEST(VersionMemory, AWriteWithoutATagIsKnownByTheDigestThatAListingTells) {
+    VersionMemory m;
+    const EntityTag ours("\"qvTGHdzF6KLavt4PO0gs2a6pQ00=\""), theirs("\"ZjGdowYmVGmkEvPd+SCZZXpTMWE=\"");
+    m.wrote("u", EntityTag(), Date(1000), "hello");
+    EXPECT_FALSE(m.knows("u", {theirs, Date(1000), 5})) << "another's, of our size and second";
+    EXPECT_TRUE(m.knows("u", {ours, Date(2000), 5})) << "whatever date it has";
+    EXPECT_FALSE(m.knows("u", {theirs, Date(1000), 5}));
 }
 
 TEST(VersionMemory, IsBounded) {
