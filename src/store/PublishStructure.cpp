@@ -71,7 +71,12 @@ bool PublishStructure::check(bool create) {
     if (!create) return false;
     // Something is missing: it may be more than the first look showed.
     if (!missing.tree && !missing.people) missing = look(true);
-    if (!missing.known || !complete(missing)) return false;
+    if (!missing.known) return false;
+    if (!complete(missing)) {
+        // Perhaps because somebody else is making it, too: servers answer variously to one of two at the same time.
+        const Missing left = look(true);
+        if (!left.known || left == missing || (left.anything() && !complete(left))) return false;
+    }
     _doubtful = false;
     return true;
 }

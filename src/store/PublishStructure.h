@@ -24,6 +24,7 @@ private:
         bool known = false; // the store gave an answer that can be believed
         bool tree = false, people = false, dateFile = false, info = false;
         std::vector<int> buckets;
+        bool operator==(const Missing&) const = default;
         bool anything() const { return tree || people || dateFile || info || !buckets.empty(); }
     };
     Missing look(bool everything);
