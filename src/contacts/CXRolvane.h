@@ -159,7 +159,8 @@ public:
     // After a pass whose full scan read everything modified after `scannedSince` and compared all groups: moves the
     // cursor to the position taken before that scan, so that what was captured is not delivered once more. Entries of
     // saves dated at or before `scannedSince` were not captured (they were saved while an earlier pass ended): the
-    // cursor stops in front of the first of them and they are delivered. Never moves backwards. Durable on return.
+    // cursor stops in front of the first of them and they are delivered, without those behind it that were captured
+    // (a new process delivers all). Never moves backwards. Durable on return.
     void advanceCursorTo(int64_t position, Date scannedSince);
     // The records that other programs have saved behind one position of the journal, up to another.
     std::vector<UniqueId> changedByOthers(int64_t after, int64_t until);

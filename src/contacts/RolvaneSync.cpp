@@ -55,8 +55,13 @@ bool CXRolvane::deliverExternalChanges() {
     int64_t end = _impl->journal.position();
     if (end <= from) return false;
     std::vector<CXJournalEntry> entries = _impl->journal.foreignEntries(from, end, _impl->options.program);
+    const size_t foreign = entries.size();
+    if (const auto& scanned = _impl->scanned)
+        std::erase_if(entries, [&](const CXJournalEntry& entry) {
+            return entry.sequence <= scanned->position && entry.date > scanned->since;
+        });
     if (entries.empty()) {
-        if (end - from > kOwnEntriesKept) _impl->journal.setCursor(_impl->options.program, end);
+        if (foreign > 0 || end - from > kOwnEntriesKept) _impl->journal.setCursor(_impl->options.program, end);
         return false;
     }
     _impl->delivering = true;
@@ -104,6 +109,7 @@ void CXRolvane::advanceCursorTo(int64_t position, Date scannedSince) {
         _impl->journal.firstForeignNotAfter(from, position, _impl->options.program, scannedSince);
     int64_t to = missed ? *missed - 1 : position;
     if (to > from) _impl->journal.setCursor(_impl->options.program, to);
+    _impl->scanned = missed ? std::optional(Impl::Scanned{position, scannedSince}) : std::nullopt;
 }
 
 std::vector<UniqueId> CXRolvane::changedByOthers(int64_t after, int64_t until) {

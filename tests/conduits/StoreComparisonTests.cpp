@@ -3,7 +3,6 @@
 #include "FakeEngine.h"
 #include "LiteralComparison.h"
 
-#include <chrono>
 #include <gtest/gtest.h>
 #include <rapidcheck/gtest.h>
 
@@ -256,10 +255,8 @@ TEST(StoreComparison, AHundredThousandMembersAreComparedAtOnce) {
         before.append(std::to_string(i) + ":CXPerson");
         now.append(std::to_string(i + 10) + ":CXPerson");
     }
-    const auto start = std::chrono::steady_clock::now();
     const Dictionary difference =
         groupDifference(Dictionary{{"memberUIDState", before}}, Dictionary{{"memberUIDState", now}});
     EXPECT_EQ(difference["memberAdds"].array().count(), 10u);
     EXPECT_EQ(difference["memberRemoves"].array().count(), 10u);
-    EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(10));
 }

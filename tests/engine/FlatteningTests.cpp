@@ -1,9 +1,9 @@
 #include "engine/ChangeQueue.h"
 
 #include "Records.h"
+#include "support/CpuTime.h"
 
 #include <algorithm>
-#include <chrono>
 #include <gtest/gtest.h>
 #include <rapidcheck/gtest.h>
 
@@ -140,10 +140,10 @@ TEST(Flattening, OneLargeGroupCostsInProportionToItsChanges) {
         CXDChangeRecords records;
         for (size_t i = 0; i < members; ++i)
             records.push_back(makeRecord(CXDAddRecordToGroup, ("P" + std::to_string(i)).c_str(), "G1"));
-        const auto start = std::chrono::steady_clock::now();
-        const CXDChangeRecords flat = flattenGroupChanges(records);
-        EXPECT_EQ(flat.size(), 1u);
-        return std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
+        return test::leastCpuSeconds([&](const auto& start) {
+            start();
+            EXPECT_EQ(flattenGroupChanges(records).size(), 1u);
+        });
     };
     const double small = std::max(seconds(2000), 1e-4);
     EXPECT_LT(seconds(20000), 40 * small);

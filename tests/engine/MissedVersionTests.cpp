@@ -51,7 +51,7 @@ TEST_F(Versions, AnOwnerReadsNothingBackWhatsoeverItHasWritten) {
     EXPECT_EQ(alice.reads("People"), 0u) << alice.wire->text();
     EXPECT_EQ(alice.wire->count("HEAD"), 1u) << "the clock file's\n" << alice.wire->text();
     expectQuietPass(alice);
-    alice.start(); // the memory of versions goes with the process
+    alice.start(); // with the memory of what it has written
     alice.pass();
     expectQuietPass(alice);
 }

@@ -53,6 +53,7 @@ PrivateStore& UserWorld::store() {
         PrivateStoreOptions options;
         options.stateDirectory = home / "store";
         options.ownsProcess = true;
+        options.accessLog = true;
         _store = std::make_unique<PrivateStore>(options);
         _store->addUser(kUser, kPassword);
         _store->start();
