@@ -20,7 +20,7 @@ struct TreePath {
     // The first `count` segments below the owner, joined by slashes.
     std::string tree(size_t count) const;
     std::string tree() const { return tree(below.size()); }
-    TreePath parent() const; // the base is its own parent
+    TreePath parent() const;                    // the base is its own parent
     bool isWithin(const TreePath& other) const; // below it, or the same place
     // A segment that httpd or its file store keep for themselves (".htaccess" and the like, ".DAV"), in any case.
     bool isReserved() const;

@@ -67,7 +67,7 @@ public:
 
     bool isGone(const UniqueId& uid) const;           // removed, whatever comes after
     bool hidesStoredLinks(const UniqueId& uid) const; // stored memberships of it count no more
-    bool changesMemberships() const; // of anything
+    bool changesMemberships() const;                  // of anything
     bool isRecordWithChanges(const UniqueId& uid) const { return _records.contains(uid); }
 
     PendingMembership& membership(const UniqueId& group) { return _memberships[group]; }

@@ -136,7 +136,8 @@ TEST_F(LocalFolder, ALinkOnTheWayLeadsNowhereBelowTheRoot) {
     EXPECT_EQ(files.removeFile(root + "/alice/secret"), ELOOP);
     EXPECT_FALSE(rooted.removeDirectoryAndContentsAtURL(url("alice/secret")));
     EXPECT_FALSE(rooted.infoForFilesInContainer(url("alice")));
-    EXPECT_EQ(std::distance(fs::directory_iterator(own), fs::directory_iterator()), 1) << "only the secret, and still it";
+    EXPECT_EQ(std::distance(fs::directory_iterator(own), fs::directory_iterator()), 1)
+        << "only the secret, and still it";
     EXPECT_EQ(contents(own + "/secret"), "mine");
 }
 
