@@ -150,6 +150,6 @@ const command_rec kDirectives[] = {
      "authentication providers that know which users exist"},
     {"DavAclDepth", asCommand(setDepth), nullptr, RSRC_CONF, TAKE1,
      "how many segments below the base may have lists of their own: 2 by default"},
-    {nullptr, {nullptr}, nullptr, 0, RAW_ARGS, nullptr}};
+    {nullptr, nullptr, nullptr, 0, RAW_ARGS, nullptr}};
 
 } // namespace rolvane::davacl

@@ -18,9 +18,16 @@
 // These are read by mod_dav.h too, and have to be before the word changes its meaning.
 #include <ctime>
 #include <string>
+#ifdef __clang__
+#pragma clang diagnostic push
+#pragma clang diagnostic ignored "-Wkeyword-macro"
+#endif
 #define namespace namespace_
 #include <mod_dav.h>
 #undef namespace
+#ifdef __clang__
+#pragma clang diagnostic pop
+#endif
 
 extern "C" __attribute__((visibility("default"))) module AP_MODULE_DECLARE_DATA davacl_module;
 APLOG_USE_MODULE(davacl);
