@@ -72,9 +72,13 @@ Json refusedJson(const Preferences& preferences) {
 std::string refusedText(const Json& record) {
     const int64_t changes = record["changes"];
     const std::string user = record["user"];
-    return fmt::format("{} change{} of {} contacts, on {}: the store does not let you write there", changes,
-                       changes == 1 ? "" : "s", user == kSelf.str() ? "your own" : user + "'s",
-                       record["date"].is_null() ? "an unknown date" : record["date"].get<std::string>());
+    const bool own = user == kSelf.str();
+    const std::string advice =
+        own ? "Have the store's administrator let you write in your tree, then edit again."
+            : fmt::format("Ask {} for `rolvane share {} --write`, then edit again.", user, CXDAVManager::vaultraUser());
+    return fmt::format("{} change{} of {} contacts, on {}: the store does not let you write there. {}", changes,
+                       changes == 1 ? "" : "s", own ? "your own" : user + "'s",
+                       record["date"].is_null() ? "an unknown date" : record["date"].get<std::string>(), advice);
 }
 
 Json status(Context& context) {
@@ -231,7 +235,7 @@ void addDaemonCommands(CLI::App& app, Context& context) {
     });
     addCommand(*daemon, context, "status", "Tell whether it runs (exit code 0 or 3)", nullptr,
                [&context] { daemonStatus(context); });
-    addCommand(app, context, "status", "Tell what is shared and how far everything is", nullptr,
+    addCommand(app, context, "status", "Tell what is shared, what waits, and what stores withdrew or refused", nullptr,
                [&context] { showStatus(context); });
     const auto options = std::make_shared<WatchOptions>();
     addCommand(

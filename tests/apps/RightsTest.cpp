@@ -146,7 +146,9 @@ TEST_F(Rights, AnEditThatCameTooLateIsRefusedToldAndLeavesTheQueue) {
     ASSERT_EQ(refused.size(), 1U) << refused;
     EXPECT_EQ(refused[0]["user"], "alice");
     EXPECT_GE(refused[0]["changes"], 1);
-    EXPECT_NE(bob.done({"status"}).find("does not let you write"), std::string::npos);
+    const std::string told = bob.done({"status"});
+    EXPECT_NE(told.find("does not let you write there. Ask alice for `rolvane share bob --write`"), std::string::npos)
+        << told;
     EXPECT_EQ(contentsOf(world.published("AllCXGroup")), before);
     world.done({"sync"});
     EXPECT_EQ(world.done({"show", "Ada"}).find("too late"), std::string::npos);
