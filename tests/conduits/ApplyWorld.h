@@ -1,6 +1,7 @@
 #pragma once
 
 #include "CaptureWorld.h"
+#include "TestRecord.h"
 #include "store/CXFileManager.h"
 
 namespace rolvane::test {
@@ -42,9 +43,7 @@ public:
 
     static CXDChangeRecordPtr record(int type, const char* user, const char* person, const char* group,
                                      Value payload = {}) {
-        const auto uid = [](const char* text) { return text ? std::optional(UniqueId(text)) : std::nullopt; };
-        auto made = std::make_shared<CXDChangeRecord>(CXDSyncSourceVaultra, type, UserName(user), uid(person),
-                                                      uid(group), std::move(payload));
+        auto made = testRecord(CXDSyncSourceVaultra, type, person, group, std::move(payload), user);
         made->setAppliesToSources(CXDSyncSourceCX);
         return made;
     }

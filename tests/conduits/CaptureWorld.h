@@ -1,5 +1,6 @@
 #pragma once
 
+#include "DaemonDatabase.h"
 #include "FakeEngine.h"
 #include "conduits/CXDCXConduit.h"
 #include "contacts/CXRolvane.h"
@@ -126,12 +127,7 @@ public:
     ManualClock clock{Date(1'800'000'000)};
     NotificationCenter center;
     Preferences preferences{directory / "preferences.db"};
-    CXRolvane database{CXRolvane::Options{.path = directory / "contacts.db",
-                                          .program = "RolvaneManager",
-                                          .clock = &clock,
-                                          .center = &center,
-                                          .distributed = nullptr,
-                                          .runLoop = nullptr}};
+    CXRolvane database{daemonDatabase(directory, clock, center)};
     FakeEngine engine;
     std::unique_ptr<CXDCXConduit> conduit;
 };

@@ -1,6 +1,7 @@
 // What every source of contacts keeps to, whatever it is; and, by name, what each does otherwise.
 
 #include "ConduitSources.h"
+#include "TestRecord.h"
 
 #include <gtest/gtest.h>
 
@@ -28,9 +29,7 @@ protected:
         before = source->contents();
     }
     static CXDChangeRecordPtr record(int type, const char* person, const char* group, Value payload = {}) {
-        const auto uid = [](const char* text) { return text ? std::optional(UniqueId(text)) : std::nullopt; };
-        return std::make_shared<CXDChangeRecord>(CXDSyncSourcePending, type, kSelf, uid(person), uid(group),
-                                                 std::move(payload));
+        return testRecord(CXDSyncSourcePending, type, person, group, std::move(payload));
     }
     bool apply(int type, const char* person, const char* group, Value payload = {}) {
         bool denied = false;

@@ -1,6 +1,7 @@
 #pragma once
 
 #include "../store/StoreWorld.h"
+#include "DaemonDatabase.h"
 #include "FakeEngine.h"
 #include "conduits/CXDCXConduit.h"
 #include "conduits/CXDLocalConduit.h"
@@ -63,17 +64,7 @@ public:
     ManualClock clock{Date(1'800'000'000)};
     NotificationCenter center;
     Preferences preferences{directory / "preferences.db"};
-    CXRolvane database{databaseOptions()};
-
-private:
-    CXRolvane::Options databaseOptions() {
-        CXRolvane::Options options;
-        options.path = directory / "contacts.db";
-        options.program = "RolvaneManager";
-        options.clock = &clock;
-        options.center = &center;
-        return options;
-    }
+    CXRolvane database{daemonDatabase(directory, clock, center)};
 };
 
 // Files below a directory, relative path to contents; what the server keeps for itself and the clock file are left out.

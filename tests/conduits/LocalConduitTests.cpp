@@ -1,6 +1,8 @@
 #include "conduits/CXDLocalConduit.h"
 
+#include "DaemonDatabase.h"
 #include "FakeEngine.h"
+#include "TestRecord.h"
 #include "contacts/CXRolvane.h"
 #include "contacts/Constants.h"
 #include "foundation/Paths.h"
@@ -28,25 +30,13 @@ protected:
         fs::create_directory(root);
         conduit = make();
     }
-    CXRolvane::Options databaseOptions() {
-        CXRolvane::Options options;
-        options.path = directory / "contacts.db";
-        options.program = "RolvaneManager";
-        options.clock = &clock;
-        options.center = &center;
-        return options;
-    }
     std::unique_ptr<CXDLocalConduit> make() {
         return std::make_unique<CXDLocalConduit>(
             engine, CXDLocalConduit::World{database, preferences, clock, UserName("ada"), root});
     }
     static CXDChangeRecordPtr record(int type, const char* person, const char* group, Value payload = {},
                                      const char* user = "<self>") {
-        const auto optional = [](const char* text) {
-            return text ? std::optional(UniqueId(text)) : std::optional<UniqueId>();
-        };
-        return std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, type, UserName(user), optional(person),
-                                                 optional(group), std::move(payload));
+        return testRecord(CXDSyncSourceCX, type, person, group, std::move(payload), user);
     }
     bool apply(int type, const char* person, const char* group, Value payload = {}, const char* user = "<self>") {
         return conduit->applyChangeRecord(record(type, person, group, std::move(payload), user));
@@ -72,7 +62,7 @@ protected:
     ManualClock clock{Date(1'800'000'000)};
     Preferences preferences{directory / "preferences.db"};
     NotificationCenter center;
-    CXRolvane database{databaseOptions()};
+    CXRolvane database{daemonDatabase(directory, clock, center)};
     CapturingLog log;
     std::unique_ptr<CXDLocalConduit> conduit;
 };

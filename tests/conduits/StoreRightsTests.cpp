@@ -1,4 +1,5 @@
 #include "../store/AclStore.h"
+#include "DaemonDatabase.h"
 #include "FakeEngine.h"
 #include "acl/CXDAVACLManager.h"
 #include "conduits/CXDVaultraConduit.h"
@@ -71,12 +72,7 @@ protected:
     NotificationCenter center;
     LocalNotifications distributed;
     Preferences preferences{directory / "preferences.db"};
-    CXRolvane database{CXRolvane::Options{.path = directory / "contacts.db",
-                                          .program = "RolvaneManager",
-                                          .clock = &clock,
-                                          .center = &center,
-                                          .distributed = nullptr,
-                                          .runLoop = nullptr}};
+    CXRolvane database{daemonDatabase(directory, clock, center)};
     CapturingLog log;
     std::unique_ptr<CXDVaultraConduit> conduit;
 };

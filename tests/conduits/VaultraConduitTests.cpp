@@ -2,6 +2,7 @@
 
 #include "../store/StoreWorld.h"
 #include "FakeEngine.h"
+#include "TestRecord.h"
 #include "conduits/UserAlert.h"
 #include "contacts/CXRolvane.h"
 #include "contacts/Constants.h"
@@ -77,11 +78,7 @@ protected:
     }
     static CXDChangeRecordPtr record(int type, const char* person, const char* group, Value payload = {},
                                      const char* user = "<self>") {
-        const auto optional = [](const char* text) {
-            return text ? std::optional(UniqueId(text)) : std::optional<UniqueId>();
-        };
-        return std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, type, UserName(user), optional(person),
-                                                 optional(group), std::move(payload));
+        return testRecord(CXDSyncSourceCX, type, person, group, std::move(payload), user);
     }
     bool apply(const CXDChangeRecordPtr& what) {
         denied = true; // whoever answers has to say so
