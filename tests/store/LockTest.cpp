@@ -142,6 +142,18 @@ TEST_F(Locks, AStoreThatCannotBeReachedGivesNoLock) {
     EXPECT_FALSE(mine->locked());
 }
 
+TEST_F(Locks, WhoMayNotLockNeedsNoneAndTheWriteSaysSo) {
+    Client bob{world, "bob"};
+    auto none = makeStoreLock(bob.manager, bob.at("dateFile")); // alice's tree, never shared
+    EXPECT_TRUE(none->tryLock());
+    EXPECT_FALSE(none->locked());
+    EXPECT_EQ(bob.write("dateFile", "who"), 403);
+    EXPECT_TRUE(lock(alice)->tryLock()) << "the owner's is free";
+    bob.wire->clear();
+    none->unlock();
+    EXPECT_EQ(bob.wire->methods(), "") << "there is nothing to give back";
+}
+
 class FileLocks : public testing::Test {
 protected:
     TempDirectory directory;

@@ -72,6 +72,45 @@ TEST_F(Publishing, TwoClientsMayMakeTheStructureAtTheSameTime) {
     EXPECT_TRUE(std::filesystem::is_directory(world.file("People/0")));
 }
 
+// Servers answer variously to one of two that make a collection at the same time; here, the other one has made it all.
+TEST_F(Publishing, ARefusalDoesNotCountWhenTheOtherClientHasMadeTheStructureMeanwhile) {
+    Client second(world);
+    bool other = false;
+    std::string serial;
+    alice.wire->intercept([&](const HttpRequest& request) -> std::optional<HttpResponse> {
+        if (request.method != "MKCOL" || !request.url.encodedPath().ends_with("/People") || other) return std::nullopt;
+        other = second.manager.sanityCheckPublishStructureCreate(true);
+        serial = world.contents("info");
+        return answerOf(403);
+    });
+    EXPECT_TRUE(alice.manager.sanityCheckPublishStructureCreate(true));
+    EXPECT_TRUE(other);
+    EXPECT_EQ(world.contents("info"), serial) << "the tree keeps its number";
+    EXPECT_EQ(alice.wire->count("PUT"), 0u) << "nothing was left to make";
+}
+
+TEST_F(Publishing, WhatTheOtherClientHadNoTimeForIsMadeAfterARefusal) {
+    Client second(world);
+    alice.wire->intercept([&](const HttpRequest& request) -> std::optional<HttpResponse> {
+        if (request.method != "MKCOL" || !request.url.encodedPath().ends_with("/People/9")) return std::nullopt;
+        alice.wire->intercept({}); // once
+        EXPECT_TRUE(second.manager.createDirectoryAtAURL(second.at("People/9")));
+        return answerOf(403);
+    });
+    EXPECT_TRUE(alice.manager.sanityCheckPublishStructureCreate(true));
+    for (int i = 0; i < 32; ++i)
+        EXPECT_TRUE(std::filesystem::is_directory(world.file("People/" + std::to_string(i)))) << i;
+    EXPECT_TRUE(std::filesystem::exists(world.file("info")));
+}
+
+TEST_F(Publishing, AStoreThatRefusesTheStructureForGoodHasNone) {
+    alice.wire->intercept([](const HttpRequest& request) {
+        return request.method == "MKCOL" ? std::optional(answerOf(403)) : std::nullopt;
+    });
+    EXPECT_FALSE(alice.manager.sanityCheckPublishStructureCreate(true));
+    EXPECT_FALSE(std::filesystem::exists(world.file("info")));
+}
+
 TEST_F(Publishing, ABucketThatVanishedIsMadeAgainByTheWriteThatMissesIt) {
     ASSERT_TRUE(alice.manager.sanityCheckPublishStructureCreate(true));
     std::filesystem::remove_all(world.file("People/4"));
