@@ -84,15 +84,18 @@ def curl(target, bodies, names, connections, directory):
     return result
 
 
+def hidden_password():
+    return subprocess.run(["rclone", "obscure", "-"], input=PASSWORD, capture_output=True, text=True,
+                          check=True).stdout.strip()
+
+
 def rclone(target, bodies, names, connections, directory):
     wanted = os.path.join(directory, "rclone.list")
     with open(wanted, "w") as out:
         out.writelines(name + "\n" for name in names)
-    hidden = subprocess.run(["rclone", "obscure", "-"], input=PASSWORD, capture_output=True, text=True,
-                            check=True).stdout.strip()
     environment = {**os.environ, "RCLONE_CONFIG": os.devnull, "RCLONE_CONFIG_STORE_TYPE": "webdav",
                    "RCLONE_CONFIG_STORE_URL": target.url, "RCLONE_CONFIG_STORE_USER": target.user,
-                   "RCLONE_CONFIG_STORE_PASS": hidden}
+                   "RCLONE_CONFIG_STORE_PASS": hidden_password()}
     return measured(target, bodies, names,
                     ["rclone", "copy", "--files-from-raw", wanted, "--transfers", str(connections), "--checkers",
                      str(connections), "--ca-cert", target.store.authority, bodies.directory, "store:"],
