@@ -1,4 +1,5 @@
 #include "Context.h"
+#include "Counted.h"
 #include "ImportReport.h"
 #include "Lookup.h"
 #include "PersonFields.h"
@@ -37,7 +38,7 @@ void importCards(Context& context, const ImportOptions& options) {
         VCardImport import(context.database(), [&](const VCardProgress& progress) {
             if (progress.bytesTotal > 0)
                 bar.update(static_cast<double>(progress.bytesDone) / static_cast<double>(progress.bytesTotal),
-                           fmt::format("{} contacts", progress.cards));
+                           counted(progress.cards, "contact", "contacts"));
         });
         for (const std::string& file : options.files) try {
                 if (file == "-")

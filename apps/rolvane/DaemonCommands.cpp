@@ -1,4 +1,5 @@
 #include "Context.h"
+#include "Counted.h"
 #include "PassWatch.h"
 #include "Publication.h"
 #include "Subscriptions.h"
@@ -76,8 +77,8 @@ std::string refusedText(const Json& record) {
     const std::string advice =
         own ? "Have the store's administrator let you write in your tree, then edit again."
             : fmt::format("Ask {} for `rolvane share {} --write`, then edit again.", user, CXDAVManager::vaultraUser());
-    return fmt::format("{} change{} of {} contacts, on {}: the store does not let you write there. {}", changes,
-                       changes == 1 ? "" : "s", own ? "your own" : user + "'s",
+    return fmt::format("{} of {} contacts, on {}: the store does not let you write there. {}",
+                       counted(changes, "change", "changes"), own ? "your own" : user + "'s",
                        record["date"].is_null() ? "an unknown date" : record["date"].get<std::string>(), advice);
 }
 
@@ -130,8 +131,7 @@ void showStatus(Context& context) {
         context.line(fmt::format("{:<15}{}", label, text));
     };
     const size_t people = s["people"], groups = s["groups"], pending = s["pending"];
-    row("Contacts",
-        fmt::format("{} {}, {} group{}", people, people == 1 ? "person" : "people", groups, groups == 1 ? "" : "s"));
+    row("Contacts", counted(people, "person", "people") + ", " + counted(groups, "group", "groups"));
     row("Daemon", s["daemon"].is_null() ? "not running (`rolvane daemon start`)"
                                         : fmt::format("running, process {}", s["daemon"].get<int>()));
     if (s["store"].is_null()) {
@@ -146,7 +146,7 @@ void showStatus(Context& context) {
     row("Subscribed", subscribedText(s["subscriptions"]));
     for (const Json& record : s["withdrawn"]) row("Withdrawn", withdrawnText(record));
     for (const Json& record : s["refused"]) row("Refused", refusedText(record));
-    row("Waiting", fmt::format("{} change{}", pending, pending == 1 ? "" : "s"));
+    row("Waiting", counted(pending, "change", "changes"));
     row("Last pass", s["lastPass"].is_null() ? "never" : s["lastPass"].get<std::string>());
 }
 

@@ -1,5 +1,7 @@
 #include "ImportReport.h"
 
+#include "Counted.h"
+
 #include <fmt/format.h>
 
 namespace rolvane::cli {
@@ -27,12 +29,13 @@ void reportImport(Context& context, const VCardImportReport& report, size_t unre
     for (const VCardError& error : report.errors)
         context.warn(fmt::format("{}:{}: {}", error.file, error.line, error.reason));
     if (report.errorCount > report.errors.size())
-        context.warn(fmt::format("and {} more bad cards", report.errorCount - report.errors.size()));
+        context.warn("and " + counted(report.errorCount - report.errors.size(), "more bad card", "more bad cards"));
     if (context.json)
         context.print(importReport(report));
     else
-        context.say(fmt::format("{} imported, {} updated, {} unchanged, {} groups, {} bad cards left out.",
-                                report.imported, report.updated, report.unchanged, report.groups, report.errorCount));
+        context.say(fmt::format("{} imported, {} updated, {} unchanged, {}, {} left out.", report.imported,
+                                report.updated, report.unchanged, counted(report.groups, "group", "groups"),
+                                counted(report.errorCount, "bad card", "bad cards")));
     if (report.errorCount + unreadable > 0)
         context.exitCode = report.imported + report.updated + report.unchanged + report.groups > 0 ? kPartly : kFailed;
 }

@@ -1,5 +1,6 @@
 #include "Passes.h"
 
+#include "Counted.h"
 #include "Publication.h"
 
 #include "daemon/DaemonControl.h"
@@ -46,7 +47,7 @@ void reportPending(Context& context) {
     if (waiting == 0) return;
     CXDAVError error;
     const bool reachable = CXDAVManager::canReachOstrelError(error);
-    context.warn(fmt::format("{} change{} wait{}: {}", waiting, waiting == 1 ? "" : "s", waiting == 1 ? "s" : "",
+    context.warn(fmt::format("{}: {}", counted(waiting, "change waits", "changes wait"),
                              reachable ? "the store did not take them yet. They are tried again in the next pass."
                                        : error.reason + " They are sent when the store can be reached again."));
     context.exitCode = reachable ? kFailed : error.code == kCXDAVErrorAuthentication ? kRefused : kUnreachable;

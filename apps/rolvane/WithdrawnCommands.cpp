@@ -1,4 +1,5 @@
 #include "Context.h"
+#include "Counted.h"
 #include "ImportReport.h"
 #include "Withdrawn.h"
 
@@ -67,8 +68,8 @@ Json withdrawnJson() {
 
 std::string withdrawnText(const Json& record) {
     const size_t people = record["people"], groups = record["groups"];
-    return fmt::format("{}'s, {} {} and {} group{}, on {}{}", record["user"].get<std::string>(), people,
-                       people == 1 ? "person" : "people", groups, groups == 1 ? "" : "s",
+    return fmt::format("{}'s, {} and {}, on {}{}", record["user"].get<std::string>(),
+                       counted(people, "person", "people"), counted(groups, "group", "groups"),
                        record["date"].get<std::string>(),
                        record["file"].is_null() ? "" : ", kept in " + record["file"].get<std::string>());
 }
