@@ -92,18 +92,22 @@ CXDChangeRecords CXDCXConduit::changeRecords() {
     engine().checkCXShareCount();
     const Date since = _lastSyncDate.value_or(Date::distantPast());
     const Scan scan{rolvane().journalPosition(), since};
+    const bool everything = forgetWhatIsPublishedAgain();
+    const Date ownSince = everything ? Date::distantPast() : since;
 
     ChangeCapture capture = newCapture();
     capture.reader().expectMany();
     for (const CXSearchElement& modified :
-         {groupsModifiedAfter<CXGroup>(since), groupsModifiedAfter<CXSubscribedGroup>(since)})
+         {groupsModifiedAfter<CXGroup>(ownSince), groupsModifiedAfter<CXSubscribedGroup>(since)})
         for (const CXRecordRef& group : rolvane().recordsMatchingSearchElement(modified))
             capture.addGroup(std::dynamic_pointer_cast<CXGroup>(group));
     addUnsettledGroups(capture);
-    for (const std::string_view table : {kCXPersonTable, kCXSubscribedPersonTable})
-        rolvane().forEachPersonModifiedSince(since, table, [&](const CXRow& person) {
-            if (person.writer != ownProgram()) capture.addPerson(person, true);
-        });
+    rolvane().forEachPersonModifiedSince(ownSince, kCXPersonTable, [&](const CXRow& person) {
+        if (everything || person.writer != ownProgram()) capture.addPerson(person, true);
+    });
+    rolvane().forEachPersonModifiedSince(since, kCXSubscribedPersonTable, [&](const CXRow& person) {
+        if (person.writer != ownProgram()) capture.addPerson(person, true);
+    });
     for (const CXSubscriptionRef& subscription : rolvane().subscriptions())
         if (subscription->_isAll() && saysSomething(*subscription))
             capture.addGroup(rolvane().allGroupForRemoteLocation(subscription->remoteLocation()));
@@ -112,6 +116,16 @@ CXDChangeRecords CXDCXConduit::changeRecords() {
     _scan = scan;
     _editsKnown = scan.journalPosition;
     return capture.take();
+}
+
+// The owner's tree has lost what it held: nothing of it counts as known any more, so that all of it is new.
+bool CXDCXConduit::forgetWhatIsPublishedAgain() {
+    Dictionary again = engine().conduitObjectForKey(kConduitCX, kPublishAgain);
+    if (again.empty() || again[kSelf.str()].boolean()) return false;
+    again.set(kSelf.str(), true);
+    for (const char* conduit : {kConduitCX, kConduitVaultra})
+        engine().conduitObjectForKey(conduit, kPriorState).remove(kSelf.str());
+    return true;
 }
 
 // The all-contacts group of a subscription by which nothing has come yet is the framework's doing and nobody's edit.

@@ -127,6 +127,7 @@ private:
 
     Dictionary priorState() const;
     ChangeCapture newCapture() const;
+    bool forgetWhatIsPublishedAgain(); // true: there is something
     bool saysSomething(const CXSubscription& subscription) const;
     void addUnsettledGroups(ChangeCapture& capture);
     const std::string& ownProgram() const;

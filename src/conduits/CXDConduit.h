@@ -97,6 +97,8 @@ protected:
     virtual CXRolvane& database() const;
     virtual Preferences& preferences() const;
     virtual WithdrawalNotice* withdrawalNotice() const; // base: none; nothing is kept and nobody is told
+    // Whether the state that was just read of a user's store is to be believed. Base: always.
+    virtual bool isTrusted(const UserName& user, const Dictionary& state);
     // Whether access lists are kept at the source, so that somebody else may have changed them. Base: yes.
     virtual bool keepsAccessLists() const { return true; }
 

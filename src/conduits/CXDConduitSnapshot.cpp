@@ -3,6 +3,7 @@
 #include "conduits/CXDConduit.h"
 #include "conduits/PublishedLayout.h"
 #include "conduits/StoreComparison.h"
+#include "conduits/TreeCondition.h"
 #include "contacts/CXRolvane.h"
 #include "contacts/Constants.h"
 #include "contacts/Identifier.h"
@@ -32,6 +33,19 @@ std::string nameOf(const std::string& path, const FileInfo& info) {
     if (!info.displayName.empty()) return info.displayName;
     const std::string_view text = std::string_view(path).substr(0, path.find_last_not_of('/') + 1);
     return std::string(text.substr(text.rfind('/') + 1));
+}
+
+// What a list of everybody would say of a store that has none: all that lies there. A list that was lost takes no group
+// along.
+Dictionary listOf(const Dictionary& userState) {
+    Array people, groups;
+    for (const auto& [contact, info] : userState[kPeopleState].dictionary()[kMemberUIDState].dictionary())
+        people.append(contact);
+    for (const auto& [name, group] : userState)
+        if (name.ends_with(kGroupSuffix)) groups.append(name);
+    Dictionary list{{kMemberUIDState, people}};
+    if (!groups.empty()) list.set(kSubgroupUIDState, groups);
+    return list;
 }
 
 Array arrayOf(const std::vector<UserName>& principals) {
@@ -79,14 +93,13 @@ void CXDConduit::readLocation(const RemoteLocation& location, Dictionary& state)
         _engine.revokeRemoteLocation(location, subscription ? std::optional(subscription->uniqueId()) : std::nullopt);
         removeRecordsAssociateWithRemoteLocation(location);
     }
-    if (!userState) return;
-    if (!userState->contains(layout::kAllGroup)) {
-        Array everybody;
-        for (const auto& [contact, info] : (*userState)[kPeopleState].dictionary()[kMemberUIDState].dictionary())
-            everybody.append(contact);
-        Dictionary(*userState).set(layout::kAllGroup, Dictionary{{kMemberUIDState, everybody}});
-    }
+    if (!userState || !isTrusted(user, *userState)) return;
+    if (!userState->contains(layout::kAllGroup)) Dictionary(*userState).set(layout::kAllGroup, listOf(*userState));
     state.set(user.str(), *userState);
+}
+
+bool CXDConduit::isTrusted(const UserName& /*user*/, const Dictionary& /*state*/) {
+    return true;
 }
 
 std::optional<Dictionary> CXDConduit::fetchWorkingStateForSubscription(const Url& base, bool* forbidden) {
@@ -109,8 +122,12 @@ std::optional<Dictionary> CXDConduit::fetchWorkingStateForSubscription(const Url
         CXLog("Could not retrieve info for files in subscription: %@", base);
         return std::nullopt;
     }
+    const std::string infoPath = base.cxURLByAppendingComponent(layout::kInfo).path();
+    const std::string clockPath = layout::dateFileLocation(base).path();
     for (const auto& [path, file] : *listing) {
         const std::string name = nameOf(path, file);
+        if (file.stored && (path == infoPath || path == clockPath))
+            state.dictionaryFor(kTreeDates).set(name, *file.stored);
         if (isASpecialFile(name) || name == layout::kPeople) continue;
         const bool isGroup = name.ends_with(kGroupSuffix);
         if (!isGroup && !name.ends_with(kPersonSuffix)) continue;

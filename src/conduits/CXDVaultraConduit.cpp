@@ -3,7 +3,11 @@
 #include "acl/CXDAVACLManager.h"
 #include "conduits/LocalizedText.h"
 #include "conduits/PublishedLayout.h"
+#include "conduits/StoreComparison.h"
+#include "conduits/TreeCondition.h"
 #include "conduits/UserAlert.h"
+#include "contacts/CXRolvane.h"
+#include "contacts/Constants.h"
 #include "foundation/Log.h"
 #include "foundation/Preferences.h"
 #include "foundation/PropertyList.h"
@@ -16,6 +20,8 @@ namespace rolvane {
 namespace {
 
 constexpr int kForbidden = 403;
+// In the prior state of the owner's tree: something was amiss there that may be so for a moment only.
+constexpr const char* kLookAgain = "LookAgain";
 
 // The payload, decoded for this one use where it stands encoded: the record keeps no tree of it.
 Dictionary contentOf(CXDChangeRecord& record) {
@@ -25,14 +31,18 @@ Dictionary contentOf(CXDChangeRecord& record) {
 
 using ACLChange = void (CXACLManager::*)(const UniqueId&, const std::vector<UniqueId>&, const UserName&);
 
-void changeACL(CXACLManager& manager, CXDChangeRecord& record, const std::vector<UniqueId>& members, ACLChange grant,
-               ACLChange deny) {
-    const Dictionary differences = record.payload().dictionary();
-    const UniqueId group = record.group().value_or(UniqueId());
+void changeACL(CXACLManager& manager, const UniqueId& group, const Dictionary& differences,
+               const std::vector<UniqueId>& members, ACLChange grant, ACLChange deny) {
     for (const Value& principal : differences[kAdditions].array())
         (manager.*grant)(group, members, UserName(principal.string()));
     for (const Value& principal : differences[kDeletions].array())
         (manager.*deny)(group, members, UserName(principal.string()));
+}
+
+Array arrayOf(const std::vector<UserName>& principals) {
+    Array all;
+    for (const UserName& principal : principals) all.append(principal);
+    return all;
 }
 
 // What the store is known to hold as members of the record's group in that user's tree.
@@ -112,6 +122,8 @@ void CXDVaultraConduit::open() {
     _lastSyncDate = _world.preferences.get(kDaemonDomain, kLastSyncDateKey).date().value_or(Date::distantPast());
     if (_vaultraOffLine) return;
     forgetSubscribersRights();
+    const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
+    _world.manager.keepSerialNumber(users[kSelf.str()].dictionary()[kSerialNumber].string());
     sanityCheckPublishStructure();
 }
 
@@ -119,6 +131,7 @@ void CXDVaultraConduit::close() {
     CXDConduit::close();
     if (_vaultraOffLine) return;
     _world.manager.saveVersionMemory();
+    if (isToBePublishedAgain()) return;
     const std::optional<Date> now = currentServerDate();
     CXDLog("Closing, last sync: %@", now);
     // A store that went away during the pass tells no date: keeping the old one costs reads, a guessed one loses edits.
@@ -169,6 +182,89 @@ void CXDVaultraConduit::warnUserAboutUserNameOrPassword() {
 Dictionary CXDVaultraConduit::currentState() {
     const CXDAVManager::Snapshot unchangedGroupsAreNotFetched(_world.manager);
     return CXDConduit::currentState();
+}
+
+// -- trees that are not what they were
+
+bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state) {
+    const bool isOwn = user == kSelf;
+    const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
+    const Dictionary* known = users[user.str()].dictionaryIf();
+    if (!known) return true;
+    Dictionary prior = *known;
+    if (isOwn && !isMended(prior, state)) return false;
+    const Value knownSerial = prior[kSerialNumber], serial = state[kSerialNumber];
+    if (!serial.isString() || (knownSerial.isString() && knownSerial != serial)) return true; // no tree, or another one
+    const TreeCondition condition = treeCondition(prior, state, isOwn ? _lastSyncDate : std::nullopt);
+    const Value looked = prior[kLookAgain];
+    prior.remove(kLookAgain);
+    if (condition.isSound()) {
+        prior.set(kTreeDates, state[kTreeDates].dictionary());
+        return true;
+    }
+    CXLog("The tree of %@ %@. %@", isOwn ? *realUserFromUser(user) : user, condition.sentence,
+          isOwn ? "It is published again." : "It is left alone until its owner has mended it.");
+    if (condition.kind == TreeCondition::Kind::setBack) prior.set(kTreeDates, datesToWaitFor(state));
+    if (!isOwn) return false;
+    if (condition.kind == TreeCondition::Kind::lostAGroup && !looked)
+        prior.set(kLookAgain, true);
+    else
+        publishAgain();
+    engine().bringSourcesUpToDate(); // after this pass
+    return false;
+}
+
+// True when nothing had to be mended, or has been long since. When the last of it is on the store: where nobody but the
+// owner may write, what is there beside it comes from an older copy, and goes.
+bool CXDVaultraConduit::isMended(const Dictionary& prior, const Dictionary& state) {
+    const Dictionary again = engine().conduitObjectForKey(kConduitCX, kPublishAgain);
+    if (again.empty()) return true;
+    if (isToBePublishedAgain()) return false;
+    engine().setConduitObjectForKey(kConduitCX, Dictionary(), kPublishAgain);
+    const auto writers = _world.rolvane.allGroup()->multiValueForProperty(kCXReadWriteSharingACLProperty);
+    if (writers && !writers->empty()) return true;
+    _leftovers = removalOfLeftovers(prior, state);
+    return _leftovers.empty();
+}
+
+CXDChangeRecords CXDVaultraConduit::changeRecords() {
+    CXDChangeRecords records = CXDConduit::changeRecords();
+    records.insert(records.end(), _leftovers.begin(), _leftovers.end());
+    _leftovers.clear();
+    return records;
+}
+
+// The next scan takes everything for new.
+void CXDVaultraConduit::publishAgain() {
+    engine().conduitObjectForKey(kConduitCX, kPublishAgain).set(kSelf.str(), false);
+    restoreAccessLists();
+}
+
+// Lists may have gone with the tree or be of another time: who was let in since then stays, who was shut out stays out.
+void CXDVaultraConduit::restoreAccessLists() {
+    const auto base = baseLocationForUser(realUserFromUser(kSelf));
+    if (!base || !keepsAccessLists()) return;
+    if (_ACLManagerMap) _ACLManagerMap->erase(base->absoluteString()); // it knows what was there
+    const auto manager = ACLManagerForRemoteLocation(*base);
+    if (!manager || !manager->isKnown()) return;
+    const Dictionary groups = engine().conduitObjectForKey(kConduitCX, kPriorState)[kSelf.str()].dictionary();
+    Array readers, writers;
+    for (const auto& [name, group] : groups) {
+        readers = cxArrayCombinedWithArray(readers, group.dictionary()[kCXReadSharingACLProperty].array());
+        writers = cxArrayCombinedWithArray(writers, group.dictionary()[kCXReadWriteSharingACLProperty].array());
+    }
+    const UniqueId everybody{std::string(layout::kAllGroup)};
+    changeACL(*manager, everybody, cxDifferencesBetweenArray(arrayOf(manager->principalsWithReadAccess()), readers), {},
+              &CXACLManager::grantReadPermissionForGUID, &CXACLManager::denyReadPermissionForGUID);
+    changeACL(*manager, everybody, cxDifferencesBetweenArray(arrayOf(manager->principalsWithAllAccess()), writers), {},
+              &CXACLManager::grantReadWritePermissionForGUID, &CXACLManager::denyReadWritePermissionForGUID);
+}
+
+// Until all of it is written, what the owner's tree says is not news, and nobody is told that the owner has been there.
+bool CXDVaultraConduit::isToBePublishedAgain() {
+    const Dictionary again = engine().conduitObjectForKey(kConduitCX, kPublishAgain);
+    if (again.empty()) return false;
+    return !again[kSelf.str()].boolean() || engine().hasPendingChanges(kSelf, conduitSource());
 }
 
 // -- applying
@@ -269,7 +365,8 @@ bool CXDVaultraConduit::changeGroupReadACL(CXDChangeRecord& record) {
     const auto base = baseLocationOf(record);
     const auto manager = base ? ACLManagerForRemoteLocation(*base) : nullptr;
     if (manager)
-        changeACL(*manager, record, knownMembers(engine(), realUserFromUser(record.user()), record),
+        changeACL(*manager, record.group().value_or(UniqueId()), record.payload().dictionary(),
+                  knownMembers(engine(), realUserFromUser(record.user()), record),
                   &CXACLManager::grantReadPermissionForGUID, &CXACLManager::denyReadPermissionForGUID);
     return true;
 }
@@ -278,8 +375,9 @@ bool CXDVaultraConduit::changeGroupReadWriteACL(CXDChangeRecord& record) {
     const auto base = baseLocationOf(record);
     const auto manager = base ? ACLManagerForRemoteLocation(*base) : nullptr;
     if (manager)
-        changeACL(*manager, record, knownMembers(engine(), record.user(), record),
-                  &CXACLManager::grantReadWritePermissionForGUID, &CXACLManager::denyReadWritePermissionForGUID);
+        changeACL(*manager, record.group().value_or(UniqueId()), record.payload().dictionary(),
+                  knownMembers(engine(), record.user(), record), &CXACLManager::grantReadWritePermissionForGUID,
+                  &CXACLManager::denyReadWritePermissionForGUID);
     return true;
 }
 

@@ -70,6 +70,8 @@ public:
     // location has no base location.
     std::shared_ptr<CXACLManager> ACLManagerForRemoteLocation(const Url& location) override;
 
+    // As the base's, and what an older copy of the owner's tree has brought back on the store.
+    CXDChangeRecords changeRecords() override;
     // As the base's, with every group file that has not changed since it was read last taken from the client's memory.
     Dictionary currentState() override;
 
@@ -89,8 +91,15 @@ protected:
     Preferences& preferences() const override { return _world.preferences; }
     bool keepsAccessLists() const override; // as the server announces it
     WithdrawalNotice* withdrawalNotice() const override { return _world.withdrawals; }
+    // A tree that was set back or has lost its lists says nothing about anybody's contacts, and is left alone. The
+    // owner's own is published again.
+    bool isTrusted(const UserName& user, const Dictionary& state) override;
 
 private:
+    void publishAgain();
+    void restoreAccessLists();
+    bool isMended(const Dictionary& prior, const Dictionary& state);
+    bool isToBePublishedAgain();
     void forgetSubscribersRights();
     int testReachability(); // sets _vaultraOffLine; the error's code, 0 when there was none
     std::optional<Url> baseLocationOf(const CXDChangeRecord& record) const;
@@ -109,6 +118,7 @@ private:
 
     World _world;
     std::atomic<bool> _vaultraOffLine = false;
+    CXDChangeRecords _leftovers; // of the gathering that is under way
     // The account is the manager's for good, and every record asks for its user's base location several times.
     mutable std::mutex _basesLock;
     mutable std::unordered_map<UserName, Url> _bases; // guarded by _basesLock

@@ -32,6 +32,9 @@ public:
     virtual int32_t sourcesForGUID(const UniqueId& group) = 0;
     virtual CXDConduit* conduitForSyncSource(int32_t source) = 0; // none when no conduit serves it
 
+    // Whether changes of the user's wait in the stored queue for the source. Reads the whole queue.
+    virtual bool hasPendingChanges(const UserName& /*user*/, int32_t /*source*/) { return false; }
+
     virtual void updateStateAndExitIfNeeded() = 0;
     virtual void checkCXShareCount() = 0;
     virtual void applyChangeRecords(const CXDChangeRecords& records) = 0; // a trickle pass

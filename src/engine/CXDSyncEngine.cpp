@@ -10,6 +10,7 @@
 #include "foundation/FreeMemory.h"
 #include "foundation/Log.h"
 
+#include <algorithm>
 #include <filesystem>
 #include <iterator>
 #include <utility>
@@ -256,6 +257,12 @@ CXDChangeRecords CXDSyncEngine::getPendingChanges() const {
 }
 void CXDSyncEngine::setPendingChanges(const CXDChangeRecords& records) {
     _parts->state.setPendingChanges(records);
+}
+bool CXDSyncEngine::hasPendingChanges(const UserName& user, int32_t source) {
+    const CXDChangeRecords pending = getPendingChanges();
+    return std::any_of(pending.begin(), pending.end(), [&](const CXDChangeRecordPtr& record) {
+        return record->user() == user && (record->appliesToSources() & source) != 0;
+    });
 }
 void CXDSyncEngine::setRemoteLocationForSubscriptionUID(const std::optional<RemoteLocation>& location,
                                                         const std::optional<UniqueId>& subscription) {

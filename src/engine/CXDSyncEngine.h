@@ -62,6 +62,7 @@ public:
     void setConduitObjectForKey(const std::string& conduitID, const Value& object, const std::string& key) override;
     void syncPrefs() override;
     CXDChangeRecords getPendingChanges() const;
+    bool hasPendingChanges(const UserName& user, int32_t source) override;
     void setPendingChanges(const CXDChangeRecords& records);
     void setRemoteLocationForSubscriptionUID(const std::optional<RemoteLocation>& location,
                                              const std::optional<UniqueId>& subscription) override;

@@ -23,5 +23,8 @@ inline constexpr const char* kDistributionListState = "distributionListState"; /
 inline constexpr const char* kPriorState = "priorState";
 // Beside it, for the contact database: identifier -> true, groups that the next scan compares whatever their date.
 inline constexpr const char* kUnsettledGroups = "unsettledGroups";
+// And: owner marker -> false when the owner's published tree has lost what it held, so that the next scan takes
+// everything for new; true from that scan on until all of it is written.
+inline constexpr const char* kPublishAgain = "publishAgain";
 
 } // namespace rolvane

@@ -201,6 +201,9 @@ CXDAVManager::Snapshot::~Snapshot() {
     _impl->files.copies().endSnapshot();
 }
 
+void CXDAVManager::keepSerialNumber(const std::string& serial) {
+    _impl->structure.keepSerialNumber(serial);
+}
 bool CXDAVManager::sanityCheckPublishStructureCreate(bool create) {
     return !account().user.empty() && _impl->structure.check(create);
 }

@@ -109,6 +109,8 @@ public:
     // One request when all is there. With `create` what is missing is made; nothing that exists is written again.
     // True when the structure is complete afterwards.
     bool sanityCheckPublishStructureCreate(bool create);
+    // The serial number that the account's own tree is known by; "" for none. A tree that has lost it gets it again.
+    void keepSerialNumber(const std::string& serial);
 
     // -- access lists (RFC 3744), as account names: who may read, and who may write. A name with the scheme https is
     // asked about over TLS whatever the account says. See StoreAccessLists for what else a list may hold.

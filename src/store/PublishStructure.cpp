@@ -86,6 +86,11 @@ bool PublishStructure::repair() {
     return check(true);
 }
 
+void PublishStructure::keepSerialNumber(std::string serial) {
+    std::lock_guard guard(_mutex);
+    _serial = std::move(serial);
+}
+
 bool PublishStructure::makeTree() {
     const Url tree = base();
     if (_files.makeCollection(tree)) return true;
@@ -128,7 +133,7 @@ bool PublishStructure::complete(const Missing& missing) {
     if (!buckets.empty() && !makeAll(buckets)) return false;
     if (missing.dateFile && !writeNew(base().cxURLByAppendingComponent("dateFile"), "why")) return false;
     if (missing.info) {
-        const Dictionary info{{"SerialNumber", makeUUID()}};
+        const Dictionary info{{"SerialNumber", _serial.empty() ? makeUUID() : _serial}};
         if (!writeNew(base().cxURLByAppendingComponent("info"), PropertyList::toXML(info))) return false;
     }
     return true;

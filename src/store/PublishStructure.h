@@ -18,6 +18,9 @@ public:
     bool check(bool create);
     // After a write found a folder missing: makes what is missing. One thread at a time does it, the others wait.
     bool repair();
+    // What a lost "info" is to say again; "" for a new number. A tree that is made anew under its old number is filled
+    // by its owner, and nobody takes it for another tree.
+    void keepSerialNumber(std::string serial);
 
 private:
     struct Missing {
@@ -36,7 +39,8 @@ private:
 
     StoreSession& _session;
     StoreFiles& _files;
-    std::mutex _mutex; // one completion at a time
+    std::mutex _mutex; // one completion at a time; guards the following
+    std::string _serial;
     std::atomic<bool> _doubtful{false};
 };
 

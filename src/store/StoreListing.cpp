@@ -90,7 +90,7 @@ void StoreListing::stamp(const Url& name, const MultistatusEntry& entry, const s
                          FileInfo& info) {
     info.size = entry.length.value_or(0);
     info.etag = entry.etag;
-    info.modificationdate = entry.lastModified;
+    info.modificationdate = info.stored = entry.lastModified;
     info.seen = _versions.knows(name.absoluteString(), {entry.etag, entry.lastModified, info.size});
     // Only with both dates is it known what "now" is to the server; its files may be dated ahead of its clock.
     if (!info.seen && entry.lastModified && serverDate)

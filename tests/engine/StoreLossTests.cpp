@@ -1,24 +1,256 @@
-// Stores that lose a part of what they held.
+// Stores that lose a part of what they held, or all of it, or what was written since some backup.
 
 #include "TwoUsers.h"
 
 namespace rolvane::test {
 
-class StoreLoss : public TwoUsers {};
-
-TEST_F(StoreLoss, ALostListOfEverybodyRemovesNoContactButTheGroupsThatItNamed) {
-    bob.pass();
-    ASSERT_EQ(bob.application->listGroups(RemoteLocation(alice.base)).size(), 1u);
-    const std::filesystem::path list = world->file("AllCXGroup");
-    ASSERT_TRUE(std::filesystem::exists(list));
-    std::filesystem::remove_all(list);
-    for (int pass = 0; pass < 2; ++pass) {
-        bob.pass();
-        EXPECT_EQ(bob.countPeople(alice.base), 3u) << log.text();
-        EXPECT_TRUE(bob.application->listGroups(RemoteLocation(alice.base)).empty());
+class StoreLoss : public TwoUsers {
+protected:
+    std::filesystem::path tree() { return world->file(); }
+    // Until nothing more can travel; the owner's daemon comes first.
+    void settle() {
+        for (int i = 0; i < 3; ++i) {
+            alice.pass();
+            bob.pass();
+        }
     }
+    // With owners and dates, as an archive keeps them.
+    static void copyTree(const std::filesystem::path& from, const std::filesystem::path& to) {
+        std::filesystem::remove_all(to);
+        ASSERT_EQ(std::system(("cp -a '" + from.string() + "' '" + to.string() + "'").c_str()), 0);
+    }
+    // A copy of the tree, made an hour ago.
+    void backUp() {
+        constexpr int64_t kHour = 3600;
+        copyTree(tree(), backup);
+        for (const auto& entry : std::filesystem::recursive_directory_iterator(backup))
+            setDate(entry.path(), dateOf(entry.path()) - kHour);
+    }
+    enum class Dates { kept, lost };
+    void restore(Dates dates) {
+        copyTree(backup, tree());
+        if (dates == Dates::lost)
+            for (const auto& entry : std::filesystem::recursive_directory_iterator(tree()))
+                setDate(entry.path(), static_cast<int64_t>(Clock::system().now().secondsSince1970()) + 2);
+    }
+    // Things that happen after the backup.
+    void change() {
+        people[0]->setValue(Value("Adelheid"), kCXFirstNameProperty);
+        people.push_back(alice.add("Dora"));
+        friends->addMember(people[1]);
+        alice.group("Family", {people[3]});
+        alice.application->save();
+        settle();
+        ASSERT_EQ(copies(), alice.view());
+    }
+    void editOfBobs() {
+        bob.copyOf(people[1])->setValue(Value("Benjamin"), kCXFirstNameProperty);
+        bob.application->save();
+        settle();
+        ASSERT_EQ(firstName(people[1]), Value("Benjamin"));
+    }
+    void removals() {
+        friends->removeMember(people[2]);
+        alice.application->removeRecord(people[0]);
+        people.erase(people.begin());
+        alice.application->save();
+        settle();
+        ASSERT_EQ(copies(), alice.view());
+    }
+    void nobodyMayWrite() {
+        for (const char* list : {kCXReadSharingACLProperty, kCXReadWriteSharingACLProperty})
+            alice.application->allGroup()->removeValueForProperty(list);
+        alice.application->save();
+        alice.start(); // the list of writers is looked at once
+    }
+    void expectStoreHoldsEverything() {
+        for (const CXPersonRef& person : people)
+            EXPECT_EQ(contentOf(fileOf(person))[kCXFirstNameProperty], firstName(person)) << log.text();
+        Participant late{*world, "bob"};
+        late.subscribe(alice);
+        late.pass();
+        EXPECT_EQ(late.view(alice.base), alice.view()) << "a new subscriber\n" << log.text();
+    }
+    void expectNothingLost(const std::map<std::string, std::string>& before) {
+        EXPECT_EQ(alice.view(), before) << log.text();
+        EXPECT_EQ(copies(), before) << log.text();
+    }
+    void expectWriters(const std::vector<std::string>& expected) {
+        std::vector<std::string> readers, writers;
+        ASSERT_TRUE(alice.manager.ACLsAtURL(Url(alice.base).withScheme("https"), readers, writers));
+        EXPECT_EQ(writers, expected) << "on the store";
+        EXPECT_EQ(readers, expected) << "on the store";
+        const auto ours = alice.application->allGroup()->multiValueForProperty(kCXReadWriteSharingACLProperty);
+        EXPECT_EQ(ours ? ours->count() : 0, expected.size()) << "in the database";
+    }
+    void expectMended(const std::map<std::string, std::string>& before) {
+        bob.pass(); // before the owner has seen it
+        expectNothingLost(before);
+        for (int i = 0; i < 3; ++i) {
+            alice.pass();
+            EXPECT_EQ(alice.view(), before) << log.text();
+        }
+        settle();
+        expectNothingLost(before);
+        expectStoreHoldsEverything();
+        EXPECT_TRUE(alice.engine->getPendingChanges().empty());
+        for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
+        EXPECT_TRUE(bob.alert.told.empty());
+    }
+
+    TempDirectory place;
+    const std::filesystem::path backup = place / "backup";
+};
+
+// -- a store that was restored from an older copy
+
+TEST_F(StoreLoss, AnOlderCopyOfTheTreeTakesNothingFromAnybodyAndTheOwnersDaemonMendsIt) {
+    for (const Dates dates : {Dates::kept, Dates::lost}) {
+        SCOPED_TRACE(dates == Dates::kept ? "dates kept" : "dates lost");
+        settle();
+        backUp();
+        change();
+        editOfBobs();
+        const auto before = alice.view();
+        restore(dates);
+        expectMended(before);
+        people[1]->setValue(Value("Ben"), kCXFirstNameProperty);
+        alice.application->save();
+        settle();
+    }
+}
+
+TEST_F(StoreLoss, WhereNobodyElseMayWriteAnOlderCopyBecomesWhatTheOwnerHas) {
+    settle();
+    backUp();
+    change();
+    removals();
+    nobodyMayWrite();
+    settle();
+    expectWriters({});
+    const auto before = alice.view();
+    restore(Dates::kept);
+    expectMended(before);
+    expectWriters({}); // although the copy is of a time when somebody was
+}
+
+TEST_F(StoreLoss, WhereOthersMayWriteWhatWasDeletedSinceAnOlderCopyComesBackAndNothingElse) {
+    settle();
+    backUp();
+    change();
+    const CXPersonRef deleted = people[0], notAMember = people[2];
+    removals();
+    const auto before = alice.view();
+    restore(Dates::kept);
+    settle();
+    auto after = alice.view();
+    EXPECT_EQ(copies(), after) << log.text();
+    EXPECT_EQ(after.erase("person " + deleted->uniqueId().str()), 1u) << "nobody can tell that it was deleted";
+    EXPECT_EQ(friends->memberUniqueIds().size(), 3u);
+    alice.application->removeRecord(alice.application->recordForUniqueId(deleted->uniqueId()));
+    friends->removeMember(notAMember);
+    alice.application->save();
+    settle();
+    expectNothingLost(before);
+}
+
+TEST_F(StoreLoss, WhileTheOwnersWritesFailAnOlderCopyIsNotTakenForNews) {
+    settle();
+    backUp();
+    change();
+    const auto before = alice.view();
+    restore(Dates::kept);
+    std::atomic<bool> full = true;
+    alice.wire->intercept([&](const HttpRequest& request) {
+        return full && request.method == "PUT" ? std::optional(answerOf(507)) : std::nullopt;
+    });
+    settle();
+    expectNothingLost(before);
+    full = false;
+    expectMended(before);
+}
+
+// -- a store that was emptied
+
+TEST_F(StoreLoss, ATreeOfWhichOnlyTheSerialNumberIsLeftIsFilledAgain) {
+    settle();
+    change();
+    const auto before = alice.view();
+    for (const auto& entry : std::filesystem::directory_iterator(tree()))
+        if (entry.path().filename() != "info") std::filesystem::remove_all(entry.path());
+    expectMended(before);
+}
+
+TEST_F(StoreLoss, ATreeWhoseFoldersAreEmptyIsFilledAgain) {
+    settle();
+    change();
+    const auto before = alice.view();
+    for (const auto& entry : std::filesystem::recursive_directory_iterator(tree()))
+        if (entry.is_regular_file() && entry.path().filename() != "info") std::filesystem::remove(entry.path());
+    expectMended(before);
+}
+
+TEST_F(StoreLoss, LostContentsOfContactsAreWrittenAgain) {
+    settle();
+    const auto before = alice.view();
+    for (const auto& entry : std::filesystem::recursive_directory_iterator(tree() / "People"))
+        if (entry.is_regular_file()) std::filesystem::remove(entry.path());
+    expectMended(before);
+}
+
+TEST_F(StoreLoss, ATreeThatIsGoneIsMadeAgainUnderItsSerialNumber) {
+    settle();
+    change();
+    const auto before = alice.view();
+    std::filesystem::remove_all(tree());
     alice.pass();
-    EXPECT_EQ(alice.countPeople(), 3u);
+    expectMended(before);
+    expectWriters({"bob"});
+}
+
+// Where there is nothing, not even a serial number, the subscription is over: the one thing that removes copies.
+TEST_F(StoreLoss, ASubscriberWhoFindsNoTreeKeepsTheCopiesInAFileAndTheOwnerEverything) {
+    bob.publish(); // a reason to live on
+    settle();
+    const auto before = alice.view();
+    std::filesystem::remove_all(tree());
+    bob.pass();
+    EXPECT_EQ(bob.countPeople(alice.base), 0u);
+    EXPECT_EQ(bob.withdrawn.list().size(), 1u);
+    EXPECT_EQ(bob.alert.told.size(), 1u);
+    settle();
+    EXPECT_EQ(alice.view(), before) << log.text();
+    bob.subscribe(alice);
+    settle();
+    expectNothingLost(before);
+}
+
+// -- a tree that has lost single lists
+
+TEST_F(StoreLoss, ALostListOfEverybodyTakesNothingAlongAndIsWrittenAgain) {
+    settle();
+    const auto before = alice.view();
+    ASSERT_TRUE(std::filesystem::exists(tree() / "AllCXGroup"));
+    std::filesystem::remove_all(tree() / "AllCXGroup");
+    expectMended(before);
+    EXPECT_TRUE(std::filesystem::exists(tree() / "AllCXGroup"));
+}
+
+TEST_F(StoreLoss, AGroupsLostListTakesNoMemberAlongAndIsWrittenAgain) {
+    settle();
+    const auto before = alice.view();
+    std::filesystem::remove_all(tree() / friends->uniqueId().str());
+    expectMended(before);
+}
+
+TEST_F(StoreLoss, AGroupThatAWriterDeletesIsNotTakenForALoss) {
+    settle();
+    bob.application->removeRecord(
+        bob.application->recordForUniqueId(cxUIDWithTableName(friends->uniqueId(), kCXSubscribedGroupTable)));
+    bob.application->save();
+    settle();
+    EXPECT_TRUE(alice.application->listGroups(RemoteLocation()).empty()) << log.text();
+    EXPECT_EQ(copies(), alice.view());
 }
 
 } // namespace rolvane::test

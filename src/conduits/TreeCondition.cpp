@@ -1,0 +1,102 @@
+#include "conduits/TreeCondition.h"
+
+#include "conduits/PublishedLayout.h"
+#include "conduits/StoreComparison.h"
+#include "model/PayloadKeys.h"
+
+#include <algorithm>
+#include <string>
+#include <unordered_set>
+#include <vector>
+
+namespace rolvane {
+namespace {
+
+using Kind = TreeCondition::Kind;
+
+const std::string kInfoFile(layout::kInfo), kClockFile(layout::kDateFile), kEverybody(layout::kAllGroup);
+constexpr double kResolution = 1; // seconds, of a store's dates
+
+std::optional<Date> dateIn(const Dictionary& state, const std::string& file) {
+    return state[kTreeDates].dictionary()[file].date();
+}
+
+bool isGroup(std::string_view name) {
+    return name.ends_with("CXGroup");
+}
+
+std::unordered_set<std::string> groupsThatAreListed(const Dictionary& state) {
+    std::unordered_set<std::string> listed;
+    for (const auto& [name, group] : state)
+        if (isGroup(name))
+            for (const Value& subgroup : group.dictionary()[kSubgroupUIDState].array())
+                listed.insert(subgroup.string());
+    return listed;
+}
+
+bool hasLostAGroup(const Dictionary& prior, const Dictionary& current) {
+    std::vector<std::string> missing;
+    for (const auto& [name, group] : prior)
+        if (isGroup(name) && name != kEverybody && !group.dictionary().empty() && current[name].dictionary().empty())
+            missing.push_back(name);
+    if (missing.empty()) return false;
+    const auto listed = groupsThatAreListed(current);
+    return std::any_of(missing.begin(), missing.end(), [&](const auto& name) { return listed.contains(name); });
+}
+
+bool isSetBack(const Dictionary& prior, const Dictionary& current, const std::optional<Date>& lastVisit) {
+    const auto visited = dateIn(current, kClockFile);
+    for (const auto& before : {dateIn(prior, kClockFile), lastVisit})
+        if (visited && before && visited->secondsSince(*before) <= -kResolution) return true;
+    const auto made = dateIn(current, kInfoFile), madeBefore = dateIn(prior, kInfoFile);
+    return made && madeBefore && *made != *madeBefore;
+}
+
+} // namespace
+
+TreeCondition treeCondition(const Dictionary& prior, const Dictionary& current, std::optional<Date> lastVisit) {
+    if (isSetBack(prior, current, lastVisit)) return {Kind::setBack, "is a copy from another time"};
+    if (prior[kEverybody].dictionary()[kMemberUIDState].array().empty()) return {};
+    const bool hasContacts = !current[kPeopleState].dictionary()[kMemberUIDState].dictionary().empty();
+    const Value& everybody = current[kEverybody];
+    if (!everybody.dictionary().contains(kMemberUIDState) && (everybody || !hasContacts || lastVisit))
+        return {Kind::lostLists, "has lost the list of its contacts"};
+    if (hasLostAGroup(prior, current)) return {Kind::lostAGroup, "has lost a group that it still names"};
+    if (!hasContacts) return {Kind::lostContacts, "has lost the contents of its contacts"};
+    return {};
+}
+
+Dictionary datesToWaitFor(const Dictionary& current) {
+    Dictionary dates = current[kTreeDates].dictionary().mutableCopy();
+    if (const auto visited = dateIn(current, kClockFile)) dates.set(kClockFile, visited->addingSeconds(kResolution));
+    return dates;
+}
+
+CXDChangeRecords removalOfLeftovers(const Dictionary& prior, const Dictionary& current) {
+    CXDChangeRecords removals;
+    const auto remove = [&](CXDChangeType type, std::optional<UniqueId> person, std::optional<UniqueId> group,
+                            const Value& payload = {}) {
+        auto record = std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, type, kSelf, person, group, payload);
+        record->setAppliesToSources(CXDSyncSourceVaultra);
+        removals.push_back(std::move(record));
+    };
+    for (const auto& [name, state] : current) {
+        if (!isGroup(name)) continue;
+        if (!prior.contains(name)) {
+            remove(CXDDeleteGroup, std::nullopt, UniqueId(name));
+            continue;
+        }
+        const Dictionary difference = groupDifference(prior[name], state);
+        const Array members = difference[kMemberAdds].array(), groups = difference[kSubgroupAdds].array();
+        if (!members.empty() || !groups.empty())
+            remove(CXDCompositeGroupChange, std::nullopt, UniqueId(name),
+                   Dictionary{{kMemberRemoves, members}, {kSubgroupRemoves, groups}});
+    }
+    std::unordered_set<std::string> people;
+    for (const Value& person : prior[kEverybody].dictionary()[kMemberUIDState].array()) people.insert(person.string());
+    for (const auto& [person, info] : current[kPeopleState].dictionary()[kMemberUIDState].dictionary())
+        if (!people.contains(person)) remove(CXDDeleteRecord, UniqueId(person), std::nullopt);
+    return removals;
+}
+
+} // namespace rolvane

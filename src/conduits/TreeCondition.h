@@ -1,0 +1,46 @@
+#pragma once
+
+#include "foundation/Date.h"
+#include "foundation/Value.h"
+#include "model/CXDChangeRecord.h"
+
+#include <optional>
+#include <string>
+
+// Whether a published tree still is what it was: a store that is restored from an older copy, or that loses files, says
+// the same as somebody who took contacts away. Pure functions over per-user states (see StoreComparison.h), with
+//
+//   "TreeDates" -> {"info" -> date, "dateFile" -> date}    of the tree's own files, as the store gives them
+//
+// beside the groups. Whoever publishes touches "dateFile" at the end of each pass and writes "info" once. So neither a
+// "dateFile" that is older than before nor another date of "info" is anybody's doing but the store's.
+namespace rolvane {
+
+inline constexpr const char* kTreeDates = "TreeDates";
+
+struct TreeCondition {
+    enum class Kind {
+        sound,
+        setBack,      // an older copy, or a copy whose files have got new dates
+        lostLists,    // there were contacts, and what said so is gone
+        lostAGroup,   // one that the tree's own lists still name; for a moment so while somebody deletes it
+        lostContacts, // there were contacts, and there is not one file of one
+    };
+    Kind kind = Kind::sound;
+    std::string sentence; // what is wrong, for a log; empty when nothing is
+    bool isSound() const { return kind == Kind::sound; }
+};
+
+// `prior` is the state that the last pass left, `current` what the store says now, both of one tree (one serial
+// number). `lastVisit`: of the owner, the date that "dateFile" had when the owner's last pass ended.
+// The owner knows of a list that is nowhere; to a subscriber the contacts that lie there are one.
+TreeCondition treeCondition(const Dictionary& prior, const Dictionary& current, std::optional<Date> lastVisit);
+
+// Nobody but the owner can mend a tree that was set back. What to remember as its dates, so that it counts as set back
+// until its owner has been there again.
+Dictionary datesToWaitFor(const Dictionary& current);
+
+// The changes of the owner's that take off the store whatever `prior` does not know: members, groups and contacts.
+CXDChangeRecords removalOfLeftovers(const Dictionary& prior, const Dictionary& current);
+
+} // namespace rolvane

@@ -1,0 +1,129 @@
+#include "conduits/TreeCondition.h"
+
+#include "conduits/StoreComparison.h"
+#include "model/PayloadKeys.h"
+
+#include <gtest/gtest.h>
+
+namespace rolvane::test {
+namespace {
+
+using Kind = TreeCondition::Kind;
+
+constexpr Date kNow{1'800'000'000};
+
+// A tree with two contacts and a group of one of them.
+Dictionary tree(Date visited = kNow, Date made = kNow.addingSeconds(-1000)) {
+    Dictionary people;
+    for (const char* person : {"a:CXPerson", "b:CXPerson"})
+        people.set(person, Dictionary{{kModificationDate, kNow.addingSeconds(-500)}});
+    return {{kSerialNumber, "one"},
+            {kTreeDates, Dictionary{{"info", made}, {"dateFile", visited}}},
+            {kPeopleState, Dictionary{{kMemberUIDState, people}}},
+            {"AllCXGroup",
+             Dictionary{{kMemberUIDState, Array{"a:CXPerson", "b:CXPerson"}}, {kSubgroupUIDState, Array{"G:CXGroup"}}}},
+            {"G:CXGroup", Dictionary{{kMemberUIDState, Array{"a:CXPerson"}}}}};
+}
+Kind kindOf(const Dictionary& prior, const Dictionary& current, std::optional<Date> lastVisit = std::nullopt) {
+    const TreeCondition condition = treeCondition(prior, current, lastVisit);
+    EXPECT_EQ(condition.isSound(), condition.sentence.empty());
+    return condition.kind;
+}
+Dictionary without(Dictionary state, const char* key) {
+    state.remove(key);
+    return state;
+}
+
+TEST(TreeCondition, WhatIsAsItWasOrHasGrownOrIsNotKnownYetIsSound) {
+    EXPECT_EQ(kindOf(tree(), tree()), Kind::sound);
+    EXPECT_EQ(kindOf(tree(), tree(kNow.addingSeconds(300))), Kind::sound) << "its owner has been there";
+    EXPECT_EQ(kindOf(tree(), tree(), kNow), Kind::sound);
+    EXPECT_EQ(kindOf({}, tree()), Kind::sound);
+    EXPECT_EQ(kindOf({}, {}), Kind::sound);
+    EXPECT_EQ(kindOf(without(tree(), kTreeDates), tree(kNow.addingSeconds(-9999))), Kind::sound);
+    EXPECT_EQ(kindOf(tree(), without(tree(), kTreeDates)), Kind::sound) << "a store that gives no dates";
+}
+
+TEST(TreeCondition, AClockFileOlderThanBeforeIsASetback) {
+    EXPECT_EQ(kindOf(tree(), tree(kNow.addingSeconds(-1))), Kind::setBack);
+    EXPECT_EQ(kindOf(tree(), tree(kNow.addingSeconds(-0.5))), Kind::sound) << "dates count to the second";
+    EXPECT_EQ(kindOf(without(tree(), kTreeDates), tree(), kNow.addingSeconds(1)), Kind::setBack)
+        << "older than at the owner's last visit";
+}
+
+TEST(TreeCondition, AnotherDateOfTheInformationIsASetbackToo) {
+    for (const double seconds : {-1.0, 1.0, 5000.0})
+        EXPECT_EQ(kindOf(tree(), tree(kNow, kNow.addingSeconds(-1000 + seconds))), Kind::setBack) << seconds;
+}
+
+TEST(TreeCondition, ATreeThatWasSetBackIsWaitedForUntilItsOwnerHasBeenThere) {
+    for (const Date made : {kNow.addingSeconds(-1000), kNow.addingSeconds(7)}) {
+        Dictionary prior = tree();
+        const Dictionary copy = tree(kNow.addingSeconds(-100), made);
+        ASSERT_EQ(kindOf(prior, copy), Kind::setBack);
+        for (int look = 0; look < 3; ++look) {
+            prior.set(kTreeDates, datesToWaitFor(copy));
+            EXPECT_EQ(kindOf(prior, copy), Kind::setBack);
+        }
+        EXPECT_EQ(kindOf(prior, tree(kNow.addingSeconds(-50), made)), Kind::sound);
+    }
+}
+
+TEST(TreeCondition, ALostListOfEverybodyIsALossToTheOwnerAndToOthersOnlyWithoutAnyContact) {
+    const Dictionary lost = without(tree(), "AllCXGroup");
+    EXPECT_EQ(kindOf(tree(), lost), Kind::sound);
+    EXPECT_EQ(kindOf(tree(), lost, kNow), Kind::lostLists);
+    EXPECT_EQ(kindOf(tree(), without(lost, kPeopleState)), Kind::lostLists);
+    EXPECT_EQ(kindOf(without(tree(), "AllCXGroup"), lost, kNow), Kind::sound) << "there never was one";
+}
+
+TEST(TreeCondition, AListThatIsThereAndNamesNobodyAtAllIsALossAndAnEmptyOneIsNot) {
+    Dictionary current = tree();
+    current.set("AllCXGroup", Dictionary());
+    EXPECT_EQ(kindOf(tree(), current), Kind::lostLists);
+    current.set("AllCXGroup", Dictionary{{kMemberUIDState, Array()}});
+    EXPECT_EQ(kindOf(tree(), current), Kind::sound) << "its owner has deleted everybody";
+}
+
+TEST(TreeCondition, AGroupThatIsGoneAndStillNamedIsALossAndADeletedOneIsNot) {
+    Dictionary current = without(tree(), "G:CXGroup");
+    EXPECT_EQ(kindOf(tree(), current), Kind::lostAGroup);
+    current.set("G:CXGroup", Dictionary());
+    EXPECT_EQ(kindOf(tree(), current), Kind::lostAGroup) << "its folder is left";
+    current.set("AllCXGroup", Dictionary{{kMemberUIDState, Array{"a:CXPerson", "b:CXPerson"}}});
+    EXPECT_EQ(kindOf(tree(), current), Kind::sound);
+}
+
+TEST(TreeCondition, ContactsWithoutASingleFileAreALoss) {
+    Dictionary current = without(tree(), kPeopleState);
+    EXPECT_EQ(kindOf(tree(), current), Kind::lostContacts);
+    current.set(kPeopleState, Dictionary{{kMemberUIDState, Dictionary{{"a:CXPerson", Dictionary()}}}});
+    EXPECT_EQ(kindOf(tree(), current), Kind::sound) << "one that is away is nobody's news";
+}
+
+TEST(TreeCondition, WhatTheOwnerDoesNotKnowIsTakenOffTheStoreAndNothingElse) {
+    EXPECT_TRUE(removalOfLeftovers(tree(), tree()).empty());
+    Dictionary current = Value(tree()).deepMutableCopy().dictionary();
+    current.dictionaryFor("AllCXGroup").arrayFor(kMemberUIDState).append("old:CXPerson");
+    current.dictionaryFor("AllCXGroup").arrayFor(kSubgroupUIDState).append("H:CXGroup");
+    current.dictionaryFor("G:CXGroup").arrayFor(kMemberUIDState).append("b:CXPerson");
+    current.dictionaryFor(kPeopleState).dictionaryFor(kMemberUIDState).set("old:CXPerson", Dictionary());
+    current.set("H:CXGroup", Dictionary{{kMemberUIDState, Array{"old:CXPerson"}}});
+    std::vector<std::string> seen;
+    for (const CXDChangeRecordPtr& record : removalOfLeftovers(tree(), current)) {
+        EXPECT_EQ(record->user(), kSelf);
+        EXPECT_EQ(record->initialSource(), CXDSyncSourceCX);
+        EXPECT_EQ(record->appliesToSources(), CXDSyncSourceVaultra);
+        std::string text = std::to_string(record->type());
+        if (record->person()) text += " " + record->person()->str();
+        if (record->group()) text += " " + record->group()->str();
+        for (const char* key : {kMemberRemoves, kSubgroupRemoves})
+            for (const Value& each : record->payload().dictionary()[key].array()) text += " -" + each.string();
+        seen.push_back(text);
+    }
+    EXPECT_EQ(seen, (std::vector<std::string>{"3 AllCXGroup -old:CXPerson -H:CXGroup", "3 G:CXGroup -b:CXPerson",
+                                              "261 H:CXGroup", "260 old:CXPerson"}));
+}
+
+} // namespace
+} // namespace rolvane::test
