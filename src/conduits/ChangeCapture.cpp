@@ -1,6 +1,7 @@
 #include "conduits/ChangeCapture.h"
 
 #include "contacts/Identifier.h"
+#include "model/PayloadKeys.h"
 #include "model/RemoteLocationMap.h"
 
 #include <algorithm>
@@ -46,35 +47,65 @@ void ChangeCapture::addPerson(const std::optional<CXRow>& person, bool update) {
 }
 
 void ChangeCapture::addPerson(const CXRow& person, bool update) {
-    for (const Captured& at : captured(person)) {
-        _records.insert(_records.end(), at.records.begin(), at.records.end());
-        if (update) continue;
-        auto entry = std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, CXDAddRecordToGroup, at.destination.user,
+    const CapturedPerson known = captured(person);
+    if (update) return addCaptured(known.record, known.records);
+    uint32_t record = known.record;
+    for (uint32_t place = known.place; place < known.place + known.places; ++place) {
+        const auto& [to, records] = _places[place];
+        addCaptured(record, records);
+        record += records;
+        auto entry = std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, CXDAddRecordToGroup, to.user,
                                                        sharedPerson(person.sharingUniqueId),
                                                        UniqueId(kCXAllGroupUID)); // a subscription's all group too
-        entry->setAppliesToSources(at.destination.sources);
+        entry->setAppliesToSources(to.sources);
         _records.push_back(std::move(entry));
     }
 }
 
-const ChangeCapture::CapturedPerson& ChangeCapture::captured(const CXRow& person) {
-    const auto [found, isNew] = _people.try_emplace(person.uniqueId);
-    if (!isNew) return found->second;
+void ChangeCapture::addCaptured(uint32_t first, uint32_t count) {
+    const auto begin = _captured.begin() + first;
+    _records.insert(_records.end(), begin, begin + count);
+}
+
+ChangeCapture::CapturedPerson ChangeCapture::captured(const CXRow& person) {
+    if (const CapturedPerson* before = capturedBefore(person.uniqueId)) return *before;
+    CapturedPerson made{person.uniqueId, static_cast<uint32_t>(_places.size()), 0,
+                        static_cast<uint32_t>(_captured.size()), 0};
     for (const RemoteLocation& location : _reader.locationsOfPerson(person)) {
         const Destination to = destination(location);
+        const size_t before = _captured.size();
         auto update = std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, CXDUpdateRecord, to.user,
                                                         sharedPerson(person.sharingUniqueId), std::nullopt);
         update->setEncodedPayload(person.encoded);
         update->setAppliesToSources(to.sources);
-        CXDChangeRecords records = distributionLists(person, to);
-        records.insert(records.begin(), std::move(update));
-        found->second.push_back({to, std::move(records)});
+        _captured.push_back(std::move(update));
+        addDistributionLists(person, to, _captured);
+        _places.push_back({to, static_cast<uint32_t>(_captured.size() - before)});
     }
-    return found->second;
+    made.places = static_cast<uint32_t>(_places.size()) - made.place;
+    made.records = static_cast<uint32_t>(_captured.size()) - made.record;
+    _byIdentifier.add(made.uniqueId.text().hash(), static_cast<uint32_t>(_people.size()));
+    return _people.emplace_back(std::move(made));
 }
 
-CXDChangeRecords ChangeCapture::distributionLists(const CXRow& person, const Destination& to) {
-    CXDChangeRecords records;
+// Groups mostly list people in the order in which they have been read.
+const ChangeCapture::CapturedPerson* ChangeCapture::capturedBefore(const UniqueId& uniqueId) const {
+    if (_following >= _people.size() || _people[_following].uniqueId != uniqueId) {
+        const auto isIt = [&](uint32_t place) { return _people[place].uniqueId == uniqueId; };
+        const uint32_t place = _byIdentifier.find(uniqueId.text().hash(), isIt);
+        if (place == NumberTable::kNone) return nullptr;
+        _following = place;
+    }
+    return &_people[_following++];
+}
+
+// The same identifier, whose text the records share where the person has been captured.
+UniqueId ChangeCapture::sharedText(const UniqueId& uid) const {
+    const CapturedPerson* before = capturedBefore(uid);
+    return before ? before->uniqueId : uid;
+}
+
+void ChangeCapture::addDistributionLists(const CXRow& person, const Destination& to, CXDChangeRecords& records) {
     for (const UniqueId& group : person.parentGroups) {
         auto record = std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, CXDUpdateDistributionList, to.user,
                                                         sharedPerson(person.sharingUniqueId), sharedGroup(group),
@@ -82,11 +113,10 @@ CXDChangeRecords ChangeCapture::distributionLists(const CXRow& person, const Des
         record->setAppliesToSources(to.sources);
         records.push_back(std::move(record));
     }
-    return records;
 }
 
 void ChangeCapture::addDistributionLists(const CXRow& person, int32_t sources, const UserName& user) {
-    add(distributionLists(person, {user, sources}));
+    addDistributionLists(person, {user, sources}, _records);
 }
 
 // -- groups
@@ -101,7 +131,8 @@ void ChangeCapture::addGroup(const CXGroupRef& group) {
     const UniqueId guid = cxUIDWithTableName(group->sharingUniqueId(), kCXGroupTable);
     const Dictionary priorOfUser = _priorState.dictionaryFor(destination(*location).user.str());
     // The all-contacts group's distribution lists are never compared, so they are not read.
-    const Dictionary current = _reader.groupState(*group, guid.str() != kCXAllGroupUID);
+    const Dictionary current = _reader.groupState(*group, guid.str() != kCXAllGroupUID,
+                                                  [this](const UniqueId& uid) { return sharedText(uid); });
     addComparison(priorOfUser[guid.str()], current, guid, *location, group.get());
     _underway.erase(underway);
 }
@@ -112,7 +143,7 @@ void ChangeCapture::addComparison(const Value& prior, const Value& current, cons
     GroupAddress address{guid, to.user, to.sources, std::nullopt};
     if (!prior && current) address.allGroup = allGroupAt(location, to.user);
     const GroupSteps steps = compareGroupStates(prior, current, address);
-    if (group) readNewMembers(steps, *group);
+    if (group) readNewMembers(steps, *group, current.dictionary()[kMemberUIDState].array().count());
     for (const GroupStep& step : steps) {
         if (const auto* record = std::get_if<CXDChangeRecordPtr>(&step))
             _records.push_back(*record);
@@ -133,12 +164,7 @@ std::optional<UniqueId> ChangeCapture::allGroupAt(const RemoteLocation& location
 void ChangeCapture::addMember(const UniqueId& member) {
     if (const auto known = _reader.knownPersonFor(member)) {
         if (_arrived.contains(*known)) return;
-        const auto found = _people.find(*known);
-        if (found != _people.end()) {
-            for (const Captured& at : found->second)
-                _records.insert(_records.end(), at.records.begin(), at.records.end());
-            return;
-        }
+        if (const CapturedPerson* before = capturedBefore(*known)) return addCaptured(before->record, before->records);
     }
     const auto person = _reader.personForUniqueId(member);
     if (person && !cameFromPublisher(*person)) addPerson(*person, true);
@@ -150,7 +176,7 @@ bool ChangeCapture::cameFromPublisher(const CXRow& person) const {
 
 // Many new members: the data of those that are not captured yet is read together, so that announcing them finds it
 // here.
-void ChangeCapture::readNewMembers(const GroupSteps& steps, const CXGroup& group) {
+void ChangeCapture::readNewMembers(const GroupSteps& steps, const CXGroup& group, size_t members) {
     size_t added = 0;
     for (const GroupStep& step : steps) added += std::holds_alternative<CaptureMember>(step) ? 1 : 0;
     if (added < kFew) return;
@@ -158,10 +184,10 @@ void ChangeCapture::readNewMembers(const GroupSteps& steps, const CXGroup& group
     std::unordered_set<UniqueId> wanted;
     for (const GroupStep& step : steps) {
         const auto* member = std::get_if<CaptureMember>(&step);
-        if (member && !_people.contains(_reader.knownPersonFor(member->person).value_or(member->person)))
+        if (member && !capturedBefore(_reader.knownPersonFor(member->person).value_or(member->person)))
             wanted.insert(member->person);
     }
-    if (wanted.size() < kFew || wanted.size() * kRowsPerLookup < group.memberCount()) return;
+    if (wanted.size() < kFew || wanted.size() * kRowsPerLookup < members) return;
     _reader.expectMany();
     _reader.forEachMember(group, wanted, [this](const CXRow& row) {
         if (cameFromPublisher(row))

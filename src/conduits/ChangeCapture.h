@@ -3,6 +3,7 @@
 #include "conduits/ConduitEngine.h"
 #include "conduits/ContactReader.h"
 #include "conduits/GroupComparison.h"
+#include "foundation/NumberTable.h"
 #include "model/CXDChangeRecord.h"
 
 #include <memory>
@@ -43,19 +44,26 @@ private:
         UserName user;
         int32_t sources;
     };
-    // A person's records for one location.
+    // A person's records for one location: so many in `_captured`, one after the other.
     struct Captured {
         Destination destination;
-        CXDChangeRecords records;
+        uint32_t records;
     };
-    using CapturedPerson = std::vector<Captured>;
+    struct CapturedPerson {
+        UniqueId uniqueId;
+        uint32_t place, places;   // in `_places`
+        uint32_t record, records; // in `_captured`
+    };
 
     Destination destination(const RemoteLocation& location);
-    const CapturedPerson& captured(const CXRow& person);
-    CXDChangeRecords distributionLists(const CXRow& person, const Destination& to);
+    CapturedPerson captured(const CXRow& person);
+    const CapturedPerson* capturedBefore(const UniqueId& uniqueId) const;
+    UniqueId sharedText(const UniqueId& uid) const;
+    void addCaptured(uint32_t first, uint32_t count);
+    void addDistributionLists(const CXRow& person, const Destination& to, CXDChangeRecords& records);
     std::optional<UniqueId> allGroupAt(const RemoteLocation& location, const UserName& user) const;
     void addMember(const UniqueId& member);
-    void readNewMembers(const GroupSteps& steps, const CXGroup& group);
+    void readNewMembers(const GroupSteps& steps, const CXGroup& group, size_t members); // members: of the group now
     bool cameFromPublisher(const CXRow& person) const;
 
     ConduitEngine& _engine;
@@ -64,9 +72,13 @@ private:
     const std::string _ownProgram;
     CXDChangeRecords _records;
     std::unordered_map<RemoteLocation, Destination> _destinations;
-    std::unordered_map<UniqueId, CapturedPerson> _people; // by uniqueId
-    std::unordered_set<UniqueId> _arrived;                // members whose data came from their publisher
-    std::set<UniqueId> _underway;                         // groups whose comparison is under way, by uniqueId
+    std::vector<CapturedPerson> _people;
+    NumberTable _byIdentifier;             // places in _people, by uniqueId
+    mutable size_t _following = 0;         // the place in _people behind the last one that was asked for
+    std::vector<Captured> _places;         // of all people
+    CXDChangeRecords _captured;            // of all people
+    std::unordered_set<UniqueId> _arrived; // members whose data came from their publisher
+    std::set<UniqueId> _underway;          // groups whose comparison is under way, by uniqueId
 };
 
 } // namespace rolvane

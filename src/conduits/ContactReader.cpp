@@ -20,11 +20,12 @@ Dictionary choicesUnder(const std::map<UniqueId, CXDistributionChoices>& all, co
     return found == all.end() ? Dictionary() : asDictionary(found->second);
 }
 
-Array normalized(const std::vector<UniqueId>& identifiers) {
-    Array all;
+Array normalized(const std::vector<UniqueId>& identifiers, const ContactReader::TextSharing& share) {
+    std::vector<Value> all;
     all.reserve(identifiers.size());
-    for (const UniqueId& identifier : identifiers) all.append(cxNormalizedUID(identifier));
-    return all;
+    for (const UniqueId& identifier : identifiers)
+        all.emplace_back(cxNormalizedUID(share ? share(identifier) : identifier));
+    return Array(std::move(all));
 }
 
 // Published or subscribed to; a location under any other label is somebody's note, not a place of sharing.
@@ -134,10 +135,10 @@ std::optional<RemoteLocation> ContactReader::locationOfGroup(const CXGroup& grou
 
 // -- group states
 
-Dictionary ContactReader::groupState(const CXGroup& group, bool withDistributionLists) const {
+Dictionary ContactReader::groupState(const CXGroup& group, bool withDistributionLists, const TextSharing& share) const {
     Dictionary state;
-    state.set(kMemberUIDState, normalized(group.memberIdentifiers()));
-    state.set(kSubgroupUIDState, normalized(group.subgroupIdentifiers()));
+    state.set(kMemberUIDState, normalized(group.memberIdentifiers(), share));
+    state.set(kSubgroupUIDState, normalized(group.subgroupIdentifiers(), {}));
     if (const std::string name = group.name(); !name.empty()) state.set(kCXGroupNameProperty, name);
     addPrincipals(state, group, kCXReadWriteSharingACLProperty);
     addPrincipals(state, group, kCXReadSharingACLProperty);

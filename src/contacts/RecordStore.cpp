@@ -218,15 +218,12 @@ std::vector<std::pair<int64_t, UniqueId>> RecordStore::recordsOf(RecordKind kind
     return all;
 }
 
-std::vector<UniqueId> RecordStore::listed(const UniqueId& group, bool groups) {
-    auto s = _database.statement(
-        groups ? "SELECT r.uid FROM listed l JOIN records r ON r.id=l.member_id "
-                 "WHERE l.group_id=(SELECT id FROM records WHERE uid=?) AND r.kind IN (3,4) ORDER BY l.position"
-               : "SELECT r.uid FROM listed l JOIN records r ON r.id=l.member_id "
-                 "WHERE l.group_id=(SELECT id FROM records WHERE uid=?) AND r.kind IN (1,2) ORDER BY l.position");
+std::vector<std::pair<UniqueId, RecordKind>> RecordStore::listed(const UniqueId& group) {
+    auto s = _database.statement("SELECT r.uid, r.kind FROM listed l JOIN records r ON r.id=l.member_id "
+                                 "WHERE l.group_id=(SELECT id FROM records WHERE uid=?) ORDER BY l.position");
     s.bind(1, group.str());
-    std::vector<UniqueId> all;
-    while (s.step()) all.emplace_back(s.text(0));
+    std::vector<std::pair<UniqueId, RecordKind>> all;
+    while (s.step()) all.emplace_back(UniqueId(s.text(0)), static_cast<RecordKind>(s.integer(1)));
     return all;
 }
 

@@ -51,8 +51,7 @@ public:
     std::optional<UniqueId> firstOfLocation(RecordKind kind, std::string_view location);
     // With row numbers, by age.
     std::vector<std::pair<int64_t, UniqueId>> recordsOf(RecordKind kind, const std::optional<std::string>& location);
-    // Members (people) or subgroups in list order.
-    std::vector<UniqueId> listed(const UniqueId& group, bool groups);
+    std::vector<std::pair<UniqueId, RecordKind>> listed(const UniqueId& group); // members and subgroups in list order
     bool isListed(const UniqueId& group, const UniqueId& member);
     int64_t countMembers(const UniqueId& group);
     int64_t countOf(RecordKind kind, const std::optional<std::string>& location);

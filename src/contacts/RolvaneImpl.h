@@ -72,7 +72,6 @@ struct CXRolvane::Impl {
     void setChoice(const UniqueId& group, const UniqueId& person, const std::string& property,
                    const std::optional<std::string>& identifier);
     void save();
-    void forgetRows() { _rows.clear(); }
 
     int64_t cursor(); // registers the program's cursor when there is none
 
@@ -87,6 +86,11 @@ private:
         std::optional<Dictionary> decoded;
     };
     CachedRow& cached(const UniqueId& uid);
+    using StoredList = std::vector<std::pair<UniqueId, RecordKind>>;
+    const StoredList& storedList(const UniqueId& group); // kept, since who asks for members asks for subgroups next
+    StoredList _list;
+    UniqueId _listedGroup;
+    uint64_t _listGeneration = 0;
     std::unordered_map<UniqueId, CachedRow> _rows; // as of `_rowsGeneration`
     uint64_t _rowsGeneration = 0;
 };

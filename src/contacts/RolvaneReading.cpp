@@ -13,6 +13,7 @@ namespace {
 
 const Dictionary kNoProperties;
 constexpr size_t kCachedRows = 256;
+constexpr size_t kKeptList = 20000; // members of the group whose list is kept
 // Row numbers of records that are not saved yet come after all stored ones, in order of their addition.
 constexpr int64_t kUnsavedRow = int64_t{1} << 60;
 
@@ -140,9 +141,20 @@ std::vector<UniqueId> CXRolvane::Impl::recordsOf(RecordKind wanted, const std::o
     return byAge(std::move(records));
 }
 
+const CXRolvane::Impl::StoredList& CXRolvane::Impl::storedList(const UniqueId& group) {
+    const uint64_t now = store.generation();
+    if (now == _listGeneration && group == _listedGroup) return _list;
+    _list = store.listed(group);
+    _listGeneration = _list.size() <= kKeptList ? now : 0;
+    _listedGroup = group;
+    return _list;
+}
+
 std::vector<UniqueId> CXRolvane::Impl::listed(const UniqueId& group, bool groups) {
     std::vector<UniqueId> all;
-    if (!work.hidesStoredLinks(group)) all = store.listed(group, groups);
+    if (!work.hidesStoredLinks(group))
+        for (const auto& [uid, is] : storedList(group))
+            if (groups ? isPlainGroup(is) : isPerson(is)) all.push_back(uid);
     if (work.empty()) return all;
     const PendingMembership* changes = work.membershipIf(group);
     std::erase_if(all, [&](const UniqueId& uid) {

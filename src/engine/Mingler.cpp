@@ -3,6 +3,7 @@
 #include "contacts/Identifier.h"
 #include "engine/RecordIdentity.h"
 #include "foundation/Log.h"
+#include "foundation/NumberTable.h"
 
 #include <algorithm>
 #include <array>
@@ -79,51 +80,11 @@ Outcome settle(const CXDChangeRecord& record, const CXDChangeRecord& element) {
     return outcome;
 }
 
-// An open-addressed table from hashes to numbers; the caller tells which of the numbers with a hash is the one. Two
-// hundred thousand numbers take a few megabytes in one piece: most of what a large pass looks up stays in the cache.
-class Numbers {
-public:
-    static constexpr uint32_t kNone = UINT32_MAX;
-
-    template <class IsIt>
-    uint32_t find(uint32_t hash, IsIt&& isIt) const {
-        if (_slots.empty()) return kNone;
-        for (size_t i = hash & mask(); _slots[i].number != kNone; i = (i + 1) & mask())
-            if (_slots[i].hash == hash && isIt(_slots[i].number)) return _slots[i].number;
-        return kNone;
-    }
-    void add(uint32_t hash, uint32_t number) {
-        if ((_count + 1) * 2 > _slots.size()) grow();
-        put({hash, number});
-        ++_count;
-    }
-
-private:
-    struct Slot {
-        uint32_t hash = 0, number = kNone;
-    };
-    size_t mask() const { return _slots.size() - 1; }
-    void put(const Slot& slot) {
-        size_t i = slot.hash & mask();
-        while (_slots[i].number != kNone) i = (i + 1) & mask();
-        _slots[i] = slot;
-    }
-    void grow() {
-        std::vector<Slot> before(std::max<size_t>(16, _slots.size() * 2));
-        before.swap(_slots);
-        for (const Slot& slot : before)
-            if (slot.number != kNone) put(slot);
-    }
-
-    std::vector<Slot> _slots;
-    size_t _count = 0;
-};
-
 uint32_t folded(size_t hash) {
     return static_cast<uint32_t>(hash ^ (hash >> 32));
 }
 
-constexpr uint32_t kNone = Numbers::kNone;
+constexpr uint32_t kNone = NumberTable::kNone;
 
 } // namespace
 
@@ -265,7 +226,7 @@ private:
 
     const List& _list;
     Elements& _elements;
-    Numbers _equal;
+    NumberTable _equal;
     std::vector<uint32_t> _all; // ascending
     size_t _removals = 0, _others = 0;
     bool _byIdentifierBuilt = false; // only needed where removals meet what is none
@@ -309,11 +270,14 @@ public:
 
 private:
     Bucket& bucketOf(const UniqueId& identifier) {
+        // What concerns one person mostly comes in a row.
+        if (!_buckets.empty() && _buckets[_latest].identifier == identifier) return _buckets[_latest];
         const uint32_t hash = identifier.text().hash();
         const uint32_t known =
             _byIdentifier.find(hash, [&](uint32_t number) { return _buckets[number].identifier == identifier; });
-        if (known != kNone) return _buckets[known];
-        _byIdentifier.add(hash, static_cast<uint32_t>(_buckets.size()));
+        if (known != kNone) return _buckets[_latest = known];
+        _latest = static_cast<uint32_t>(_buckets.size());
+        _byIdentifier.add(hash, _latest);
         _buckets.push_back({identifier, kNone, 0, nullptr});
         return _buckets.back();
     }
@@ -360,8 +324,9 @@ private:
 
     size_t _indexFrom;
     Elements _elements;
-    Numbers _byIdentifier;
+    NumberTable _byIdentifier;
     std::deque<Bucket> _buckets; // stay where they are
+    uint32_t _latest = 0;        // the bucket that was asked for last
     std::vector<Bucket*> _justAccepted;
 };
 

@@ -1,0 +1,52 @@
+#pragma once
+
+#include <algorithm>
+#include <cstddef>
+#include <cstdint>
+#include <vector>
+
+namespace rolvane {
+
+// An open-addressed table from hashes to numbers, which are places in a list of the caller's; the caller tells which of
+// the numbers with a hash is the one. Two hundred thousand numbers take a few megabytes in one piece: most of what a
+// large pass looks up stays in the processor's cache. Nothing is ever removed. One thread at a time.
+class NumberTable {
+public:
+    static constexpr uint32_t kNone = UINT32_MAX;
+
+    // The number with the hash of which `isIt(number)` is true; kNone when there is none.
+    template <class IsIt>
+    uint32_t find(uint32_t hash, IsIt&& isIt) const {
+        if (_slots.empty()) return kNone;
+        for (size_t i = hash & mask(); _slots[i].number != kNone; i = (i + 1) & mask())
+            if (_slots[i].hash == hash && isIt(_slots[i].number)) return _slots[i].number;
+        return kNone;
+    }
+    void add(uint32_t hash, uint32_t number) {
+        if ((_count + 1) * 2 > _slots.size()) grow();
+        put({hash, number});
+        ++_count;
+    }
+
+private:
+    struct Slot {
+        uint32_t hash = 0, number = kNone;
+    };
+    size_t mask() const { return _slots.size() - 1; }
+    void put(const Slot& slot) {
+        size_t i = slot.hash & mask();
+        while (_slots[i].number != kNone) i = (i + 1) & mask();
+        _slots[i] = slot;
+    }
+    void grow() {
+        std::vector<Slot> before(std::max<size_t>(16, _slots.size() * 2));
+        before.swap(_slots);
+        for (const Slot& slot : before)
+            if (slot.number != kNone) put(slot);
+    }
+
+    std::vector<Slot> _slots;
+    size_t _count = 0;
+};
+
+} // namespace rolvane
