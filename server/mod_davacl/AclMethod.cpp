@@ -1,8 +1,10 @@
 #include "server/mod_davacl/AclMethod.h"
 
 #include "server/mod_davacl/Access.h"
+#include "server/mod_davacl/Locks.h"
 #include "server/mod_davacl/PrincipalResources.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 
@@ -128,13 +130,27 @@ int answerUnmet(request_rec* r, const Unmet& unmet) {
     return dav_handle_err(r, error, nullptr);
 }
 
-int store(const Request& q, AccessList list) {
+bool grantsWriting(const AccessList& list, const Principal& principal) {
+    return std::any_of(list.begin(), list.end(),
+                       [&](const Grant& grant) { return grant.write && grant.principal == principal; });
+}
+
+bool takesWritingFromSomebody(const AccessList& before, const AccessList& after) {
+    return std::any_of(before.begin(), before.end(),
+                       [&](const Grant& grant) { return grant.write && !grantsWriting(after, grant.principal); });
+}
+
+int store(const Request& q, const dav_resource* collection, AccessList list) {
     const ListStore lists(q.c.lists);
     const auto guard = lists.guard(q.place.owner, ListStore::Hold::exclusive);
     auto known = guard ? lists.read(q.place.owner) : std::nullopt;
     if (known) {
+        const bool takesWriting = takesWritingFromSomebody(known->at(q.place.tree()), list);
         known->set(q.place.tree(), std::move(list));
-        if (lists.write(q.place.owner, *known)) return OK;
+        if (lists.write(q.place.owner, *known)) {
+            if (takesWriting) removeLocksWithoutRight(q.r, q.c, collection, *known);
+            return OK;
+        }
     }
     ap_log_rerror(
         APLOG_MARK, APLOG_ERR, errno, q.r,
@@ -155,8 +171,10 @@ int serve(request_rec* r) {
     if (dav_error* error = dav_get_resource(r, 0, 0, &resource)) return dav_handle_err(r, error, nullptr);
     if (!resource->exists) return HTTP_NOT_FOUND;
     dav_response* responses = nullptr;
+    // Nobody keeps the owner from taking rights back by locking the tree.
     if (dav_error* error = dav_validate_request(r, resource, 0, nullptr, &responses, DAV_VALIDATE_RESOURCE, nullptr))
-        return dav_handle_err(r, error, responses);
+        if (error->status != HTTP_LOCKED || !isLockedByOthersOnly(r, resource))
+            return dav_handle_err(r, error, responses);
 
     const Request q{r, *c, *place};
     AccessList list;
@@ -167,7 +185,7 @@ int serve(request_rec* r) {
         return answerUnmet(r, {"limited-number-of-aces", "Lists are set on the collections near the owner's root: " +
                                                              std::to_string(c->levels()) + " levels have them."});
     if (mayHaveOne)
-        if (const int status = store(q, std::move(list)); status != OK) return status;
+        if (const int status = store(q, resource, std::move(list)); status != OK) return status;
     r->status = HTTP_OK;
     ap_set_content_length(r, 0);
     return OK;

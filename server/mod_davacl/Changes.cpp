@@ -68,11 +68,13 @@ bool stands(request_rec* r) {
 std::optional<Missing> hold(request_rec* r, const Change& change) {
     RequestState& state = stateOf(r);
     const ListStore store(change.c->lists);
+    std::map<std::string, TreePath> owners; // each once and in one order for everybody: nobody waits in a circle
     for (const auto* place : {&change.source, &change.destination})
-        if (*place && !(*place)->isBase() && (*place)->owner != r->user) {
-            state.guards.push_back(store.guard((*place)->owner, ListStore::Hold::shared));
-            if (!state.guards.back()) return Missing{**place, kWriteContent};
-        }
+        if (*place && !(*place)->isBase() && (*place)->owner != r->user) owners.try_emplace((*place)->owner, **place);
+    for (const auto& [owner, place] : owners) {
+        state.guards.push_back(store.guard(owner, ListStore::Hold::shared));
+        if (!state.guards.back()) return Missing{place, kWriteContent};
+    }
     if (state.guards.empty()) return std::nullopt; // the owner's right does not come from a list
     state.lists.clear();
     auto missing = change.source ? missingOf(r, *change.c, *change.source, change.sourceNeeds) : std::nullopt;

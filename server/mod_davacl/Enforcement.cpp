@@ -1,6 +1,7 @@
 #include "server/mod_davacl/Enforcement.h"
 
 #include "server/mod_davacl/Access.h"
+#include "server/mod_davacl/Locks.h"
 
 #include <cstring>
 
@@ -31,7 +32,7 @@ int check(request_rec* r) {
     const Standing standing = standingOf(r);
     const auto missing =
         missingOf(r, *c, *place, destination ? needsOfDestination(r->method, standing) : needsOf(r->method, standing));
-    if (!missing) return DECLINED;
+    if (!missing || (std::strcmp(r->method, "UNLOCK") == 0 && namesOwnLock(r))) return DECLINED;
     if (!r->main) return refuse(r, *c, *missing);
     if (destination) stateOf(r).destinationLacks = missing;
     return HTTP_FORBIDDEN;

@@ -78,13 +78,18 @@ bool ListStore::write(const std::string& owner, const OwnersLists& lists) const 
     return false;
 }
 
+// Whoever waits for the lists stands in the gate meanwhile and lets nobody pass: those who share them would otherwise
+// follow one another for ever, and the owner would never get a turn.
 ListStore::Guard ListStore::guard(const std::string& owner, Hold hold) const {
-    const int file = open(pathFor(owner, ".lock").c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0600);
-    if (file < 0) return Guard();
-    Guard locked(file);
-    while (flock(file, hold == Hold::shared ? LOCK_SH : LOCK_EX) != 0)
+    const Guard gate = locked(pathFor(owner, ".gate"), LOCK_EX);
+    return gate ? locked(pathFor(owner, ".lock"), hold == Hold::shared ? LOCK_SH : LOCK_EX) : Guard();
+}
+
+ListStore::Guard ListStore::locked(const std::string& path, int how) {
+    Guard held(open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0600));
+    while (held && flock(held._file, how) != 0)
         if (errno != EINTR) return Guard();
-    return locked;
+    return held;
 }
 
 ListStore::Guard::~Guard() {

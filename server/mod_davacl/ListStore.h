@@ -7,8 +7,8 @@
 
 namespace rolvane::davacl {
 
-// The files of the lists: <directory>/<owner, encoded>.acl, one an owner, and a .lock beside it. No exception of its
-// own; any number of processes and threads.
+// The files of the lists: <directory>/<owner, encoded>.acl, one an owner, and a .lock and a .gate beside it. No
+// exception of its own; any number of processes and threads.
 class ListStore {
 public:
     explicit ListStore(std::string directory) : _directory(std::move(directory)) {}
@@ -29,14 +29,19 @@ public:
         explicit operator bool() const { return _file >= 0; }
 
     private:
+        friend class ListStore;
         int _file = -1;
     };
     enum class Hold { shared, exclusive };
-    Guard guard(const std::string& owner, Hold hold) const; // waits; false when it cannot be had
+    // Waits its turn, behind whoever came before; false when it cannot be had. A thread that holds the lists of an
+    // owner must not ask for them again, and asks for those of several owners in the order of their names.
+    Guard guard(const std::string& owner, Hold hold) const;
 
     std::string pathFor(const std::string& owner, const char* suffix = ".acl") const;
 
 private:
+    static Guard locked(const std::string& path, int how); // flock's LOCK_SH or LOCK_EX
+
     std::string _directory;
 };
 

@@ -7,9 +7,13 @@
 #include "StoreTestWorld.h"
 #include "foundation/Paths.h"
 
+#include <atomic>
+#include <fcntl.h>
+#include <future>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <rapidcheck/gtest.h>
+#include <sys/file.h>
 #include <sys/wait.h>
 #include <thread>
 #include <unistd.h>
@@ -261,6 +265,28 @@ TEST(ListStore, AProcessThatIsKilledWhileWritingLeavesOneVersionOrTheOther) {
         ASSERT_TRUE(found) << round;
         EXPECT_TRUE(*found == sample() || *found == other);
     }
+}
+
+TEST(ListStore, WhoComesWhileTheOwnerWaitsStandsBehindTheOwner) {
+    const StoreDirectory directory;
+    const ListStore store(directory.path());
+    auto writing = store.guard("alice", ListStore::Hold::shared);
+    std::atomic<int> place = 0;
+    auto owner = std::async(std::launch::async, [&] {
+        const auto held = store.guard("alice", ListStore::Hold::exclusive);
+        return held ? ++place : 0;
+    });
+    const int gate = open(store.pathFor("alice", ".gate").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
+    while (flock(gate, LOCK_EX | LOCK_NB) == 0) flock(gate, LOCK_UN); // until the owner stands there
+    close(gate);
+    auto next = std::async(std::launch::async, [&] {
+        const auto held = store.guard("alice", ListStore::Hold::shared);
+        return held ? ++place : 0;
+    });
+    EXPECT_EQ(next.wait_for(std::chrono::milliseconds(100)), std::future_status::timeout);
+    writing = ListStore::Guard();
+    EXPECT_EQ(owner.get(), 1);
+    EXPECT_EQ(next.get(), 2);
 }
 
 TEST(ListStore, AnExclusiveGuardWaitsForTheSharedOnes) {

@@ -1,4 +1,5 @@
 #include "AccessWorld.h"
+#include "foundation/Paths.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -273,6 +274,63 @@ TEST_F(AccessLists, ASlowWriterDoesNotKeepTheOwnerWaiting) {
     ASSERT_TRUE(upload.awaitContinue());
     EXPECT_EQ(set(AccessWorld::ace(AccessWorld::user("walter"), "read write")).status, 200);
     EXPECT_EQ(upload.finish().status, 201) << "who still may write is not disturbed";
+}
+
+std::string tokenOf(const RawAnswer& answer) {
+    const size_t at = answer.headers.find("<opaquelocktoken");
+    return at == std::string::npos ? "" : answer.headers.substr(at, answer.headers.find('>', at) + 1 - at);
+}
+
+TEST_F(AccessLists, AWriterCannotKeepTheOwnerFromTakingTheRightBackByLockingTheTree) {
+    const RawAnswer locked =
+        world->ask("walter", "LOCK", kTree, {{"Depth", "infinity"}, {"Timeout", "Infinite"}}, AccessWorld::kLock);
+    ASSERT_EQ(locked.status, 200);
+    EXPECT_EQ(world->status("alice", "PUT", "/dav/alice/Contacts/dateFile", {}, "x"), 423);
+    EXPECT_EQ(set(AccessWorld::ace(AccessWorld::user("walter"), "read")).status, 200);
+    EXPECT_EQ(world->status("alice", "PUT", "/dav/alice/Contacts/dateFile", {}, "x"), 204) << "the lock has gone";
+    EXPECT_EQ(world->status("alice", "PUT", "/dav/alice/Contacts/People/7/new", {}, "x"), 201);
+    EXPECT_EQ(
+        world->status("walter", "PUT", "/dav/alice/Contacts/dateFile", {{"If", "(" + tokenOf(locked) + ")"}}, "no"),
+        403);
+}
+
+TEST_F(AccessLists, TheLocksOfWhoMayNoLongerWriteGoWithTheRightAndOthersStay) {
+    using W = AccessWorld;
+    ASSERT_EQ(set(W::ace(W::user("walter"), "read write") + W::ace(W::user("sam"), "read write") +
+                  W::ace(W::group("readers"), "read write"))
+                  .status,
+              200);
+    const std::string walters = "/dav/alice/Contacts/dateFile", sams = "/dav/alice/Contacts/1:CXGroup";
+    const std::string gretas = "/dav/alice/Contacts/People/7/1:CXPerson", unborn = "/dav/alice/Contacts/unborn";
+    ASSERT_EQ(world->status("walter", "LOCK", walters, {}, W::kLock), 200);
+    ASSERT_EQ(world->status("walter", "LOCK", unborn, {}, W::kLock), 200);
+    const RawAnswer held = world->ask("sam", "LOCK", sams, {}, W::kLock);
+    ASSERT_EQ(held.status, 200);
+    ASSERT_EQ(world->status("greta", "LOCK", gretas, {}, W::kLock), 200);
+    ASSERT_EQ(set(W::ace(W::user("sam"), "read write") + W::ace(W::group("readers"), "read write")).status, 200);
+    EXPECT_EQ(world->status("alice", "PUT", walters, {}, "mine"), 204);
+    EXPECT_EQ(world->status("alice", "PUT", unborn, {}, "mine") / 100, 2);
+    EXPECT_EQ(world->status("alice", "PUT", sams, {}, "mine"), 423);
+    EXPECT_EQ(world->status("alice", "PUT", gretas, {}, "mine"), 423) << "she may write as a member of her group";
+    EXPECT_EQ(world->status("sam", "PUT", sams, {{"If", "(" + tokenOf(held) + ")"}}, "mine"), 204);
+    ASSERT_EQ(set("").status, 200);
+    EXPECT_EQ(world->status("alice", "PUT", gretas, {}, "mine"), 204);
+}
+
+TEST_F(AccessLists, WhoTookALockMayGiveItBackWithoutAnyRight) {
+    using W = AccessWorld;
+    const std::string groups = world->store.stateDirectory() + "/conf/groups";
+    const std::string before = readFile(groups);
+    const std::string path = "/dav/alice/Contacts/dateFile";
+    ASSERT_EQ(set(W::ace(W::group("readers"), "read write")).status, 200);
+    const std::string token = tokenOf(world->ask("greta", "LOCK", path, {}, W::kLock));
+    writeFileDurably(groups, "readers: nobody\n", 0644); // the administrator takes her out of the group
+    EXPECT_EQ(world->status("greta", "PUT", path, {{"If", "(" + token + ")"}}, "no"), 403);
+    EXPECT_EQ(world->status("sam", "UNLOCK", path, {{"Lock-Token", token}}), 403) << "it is not his";
+    EXPECT_EQ(world->status("greta", "UNLOCK", path, {{"Lock-Token", "<opaquelocktoken:none>"}}), 403);
+    EXPECT_EQ(world->status("greta", "UNLOCK", path, {{"Lock-Token", token}}), 204);
+    EXPECT_EQ(world->status("alice", "PUT", path, {}, "why"), 204);
+    writeFileDurably(groups, before, 0644);
 }
 
 TEST_F(AccessLists, AreProtectedFromProppatch) {
