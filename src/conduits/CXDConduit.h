@@ -76,6 +76,10 @@ public:
     // yes.
     virtual bool holds(const CXDChangeRecord& record);
 
+    // The source has refused the record, or it was given up with one that was refused: what the source holds instead
+    // counts as not seen yet, so that the next comparison offers it. Base: nothing.
+    virtual void wasRefused(const CXDChangeRecord& /*record*/) {}
+
     // True: this source is done with the record (applied, cancelled, or of a revoked location). An exception of the
     // base class costs one false and two log lines.
     bool applyChangeRecordIfNeeded(const CXDChangeRecordPtr& record, bool* denied);

@@ -283,6 +283,13 @@ bool CXDVaultraConduit::applyChangeRecord(const CXDChangeRecordPtr& record, bool
     return applied;
 }
 
+void CXDVaultraConduit::wasRefused(const CXDChangeRecord& record) {
+    const bool isContact = record.type() == CXDUpdateRecord || record.type() == CXDDeleteRecord;
+    const auto base = baseLocationOf(record);
+    if (isContact && base && record.person())
+        _world.manager.forgetVersion(layout::contactLocation(*base, *record.person()));
+}
+
 bool CXDVaultraConduit::apply(CXDChangeRecord& record, int& code) {
     // Identifiers also come out of other people's lists: one that names the tree's own files would destroy those.
     for (const auto& name : {record.person(), record.group()})

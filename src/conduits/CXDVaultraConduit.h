@@ -62,6 +62,7 @@ public:
     // the lock of the tree, nothing is sent.
     using CXDConduit::applyChangeRecord;
     bool applyChangeRecord(const CXDChangeRecordPtr& record, bool* denied) override;
+    void wasRefused(const CXDChangeRecord& record) override;
     // A refused user name or password warns the person, at most once in 15 minutes, and ends the daemon.
     void open() override;
     // The stored last-sync date moves to the server's date; off line, or when the server does not tell it, it stays.

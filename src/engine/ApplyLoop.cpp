@@ -233,7 +233,10 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
     _queueStored = true;
     const bool lookAgain = noteUnsettled() && _pendingChanges.empty();
     _pendingChanges.clear();
-    if (!_parts.denied.empty()) _parts.state.noteRefusedChanges(_parts.denied.all(), _parts.with.clock.now());
+    if (!_parts.denied.empty()) {
+        _parts.state.noteRefusedChanges(_parts.denied.all(), _parts.with.clock.now());
+        for (const CXDChangeRecordPtr& record : _parts.denied.all()) _parts.conduits.vaultra->wasRefused(*record);
+    }
     if (!_parts.denied.empty() || lookAgain) {
         _parts.denied.clear();
         if (allowRetry) _actions.scheduleRetry();

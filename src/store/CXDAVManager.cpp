@@ -228,6 +228,9 @@ bool CXDAVManager::setACLsWithReadPrincipals(const std::vector<std::string>& rea
 void CXDAVManager::saveVersionMemory() {
     _impl->versions.save();
 }
+void CXDAVManager::forgetVersion(const Url& url) {
+    _impl->versions.forget(url.absoluteString());
+}
 void CXDAVManager::abortAll() {
     _impl->session.transport().abortAll();
 }

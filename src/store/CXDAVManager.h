@@ -129,6 +129,8 @@ public:
     // Writes down which versions of files are known, so that the next run need not read them again. Losing it costs
     // reads only. Also done when the client ends.
     void saveVersionMemory();
+    // The next listing gives the file as one that was not seen yet, so that it is read once more.
+    void forgetVersion(const Url& url);
 
     // -- ending: every request under way and every later one fails at once. From any thread or a signal handler.
     void abortAll();
