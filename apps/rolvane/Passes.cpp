@@ -94,16 +94,15 @@ void makePass(Context& context, double seconds) {
             if (event.kind == PassWatch::Event::Kind::progress) bar.update(event.fraction);
             if (event.kind == PassWatch::Event::Kind::started && stoppedBefore < 0) stoppedBefore = watch.stopped();
         };
-        const auto passed = [&] {
-            const bool done = stoppedBefore >= 0 && watch.stopped() > stoppedBefore;
-            if (!done) requireDaemon(daemon);
-            return done;
-        };
-        if (!watch.waitUntil(passed, seconds))
+        const auto passed = [&] { return stoppedBefore >= 0 && watch.stopped() > stoppedBefore; };
+        const bool inVain = !watch.waitUntil([&] { return passed() || !daemon.running(); }, seconds);
+        watch.onEvent = nullptr;
+        // It was just ending, because nothing is shared any more for instance.
+        if (!inVain && !passed()) return daemon.runOnce(seconds);
+        if (inVain)
             throw CommandError(kUnreachable, fmt::format("No pass ended within {} seconds. `rolvane daemon status` "
                                                          "tells whether the daemon is at work.",
                                                          seconds));
-        watch.onEvent = nullptr;
     }
 }
 

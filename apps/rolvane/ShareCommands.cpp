@@ -84,6 +84,35 @@ std::string checkedUser(const std::string& user) {
     return user;
 }
 
+// Takes rights back on the store itself, before anybody is told: from here on nothing more is written there, whatever
+// the daemon waits for. A list that holds no such right stays as it is.
+void takeBackOnStore(const Url& base, const std::string& user, bool reading) {
+    CXDAVManager& manager = CXDAVManager::defaultManager();
+    auto lists = storeLists(base);
+    if (!lists)
+        throw CommandError(kUnreachable, "The store does not show its access list. Nothing was changed; try again "
+                                         "later.");
+    if (!StoreLists::in(lists->writers, user) && !(reading && StoreLists::in(lists->readers, user))) return;
+    std::erase(lists->writers, user);
+    if (reading) std::erase(lists->readers, user);
+    if (manager.setACLsWithReadPrincipals(lists->readers, lists->writers, base)) return;
+    const auto now = storeLists(base); // a list may be set and yet not be all that was asked for
+    if (!now || StoreLists::in(now->writers, user) || (reading && StoreLists::in(now->readers, user)))
+        throw CommandError(kFailed,
+                           "The store did not take the right back. Nothing was changed here; try again later.");
+}
+
+// What the last writer wrote while it was allowed belongs to the owner, too, and a daemon that starts without a writer
+// takes nothing from the store. So the one that knows of the writer makes another pass.
+void takeInWhatWasWritten(Context& context, double seconds) {
+    try {
+        if (!context.bus().connected()) DaemonControl().stop(); // it could not be asked
+        makePass(context, seconds);
+    } catch (const CXException& error) { // the right is taken back all the same
+        context.warn(fmt::format("What was written last may be missing here: {}", error.reason()));
+    }
+}
+
 // Has the daemon carry the lists to the store, and tells whether they are there.
 void carry(Context& context, PassWatch& watch, const ShareOptions& options, const Url& base) {
     CXRolvane& database = context.database();
@@ -126,8 +155,14 @@ void changeShares(Context& context, const ShareOptions& options, bool grant) {
     }
     requireAccessLists(base, user);
 
+    const std::vector<std::string> writers = shares.writers();
+    const bool takesBack = !grant || !options.write;
+    if (takesBack && !options.noDaemon) takeBackOnStore(base, user, !grant);
+    if (takesBack && !options.noDaemon && !options.noWait && writers == std::vector{user})
+        takeInWhatWasWritten(context, options.timeout);
+
     PassWatch watch(context);
-    const bool hadWriters = !shares.writers().empty();
+    const bool hadWriters = !writers.empty();
     grant ? shares.grant(user, options.write) : shares.deny(user);
     // What writers send is taken only by a daemon that knew of one when it started, and without a bus none hears of the
     // change. It rests before the lists are saved: ended later, it would be in the middle of carrying them.
