@@ -54,6 +54,7 @@ PrivateStore& UserWorld::store() {
         options.stateDirectory = home / "store";
         options.ownsProcess = true;
         options.accessLog = true;
+        options.extraConfiguration = storeConfiguration;
         _store = std::make_unique<PrivateStore>(options);
         _store->addUser(kUser, kPassword);
         _store->start();

@@ -34,8 +34,9 @@ public:
 
     TempHome home;
 
-    PrivateBus& bus();     // started on first use; the programs that start afterwards know it
-    PrivateStore& store(); // started on first use, with the user kUser
+    PrivateBus& bus();                           // started on first use; the programs that start afterwards know it
+    PrivateStore& store();                       // started on first use, with the user kUser
+    std::vector<std::string> storeConfiguration; // lines for the end of its configuration, set before the first use
     // Where the files of the user's published tree lie.
     std::string treeDirectory() { return store().userDirectory(kUser) + "/Contacts"; }
     // Paths of the files below it, relative, without the server's own; empty when there is no tree.
