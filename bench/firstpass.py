@@ -116,9 +116,13 @@ def measured(store, user, command, expected, **more):
     took = measuring.done()
     if done.returncode != 0:
         raise Failure(f"{command[0]} ended with {done.returncode}: {done.stderr.strip()[-400:]}")
-    requests = entries(store, measuring.log, user)
-    gets = [r for r in requests if r.method == "GET" and r.status == 200]
-    if len(gets) != expected:
+    for _ in range(20):  # a request is written down a little after its answer
+        requests = entries(store, measuring.log, user)
+        gets = [r for r in requests if r.method == "GET" and r.status == 200]
+        if len(gets) == expected:
+            break
+        time.sleep(0.05)
+    else:
         raise Failure(f"{command[0]} fetched {len(gets)} of {expected} files")
     return {"wall": took["wall"], "cpu": took["cpu"], "server_cpu": took["server_cpu"], "files": expected,
             "other_cpu": max(0.0, took["busy"] - took["server_cpu"] - took["cpu"]),

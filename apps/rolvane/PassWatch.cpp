@@ -31,7 +31,8 @@ PassWatch::PassWatch(Context& context) : _context(context) {
 void PassWatch::heard(const Event& event) {
     if (event.kind == Event::Kind::started) ++_started;
     if (event.kind == Event::Kind::stopped) ++_stopped;
-    _news = true;
+    // Progress comes thousands of times a second, and the test is not for free.
+    if (event.kind != Event::Kind::progress) _news = true;
     if (onEvent) onEvent(event);
 }
 
@@ -43,7 +44,6 @@ bool PassWatch::waitUntil(const std::function<bool()>& test, double seconds) {
     while (!test()) {
         _news = false;
         asked = Clock::now();
-        // Progress comes thousands of times a second; the test is not asked for each.
         while (!_news && Clock::now() - asked < std::chrono::duration<double>(kAskAgain) && Clock::now() < end)
             _context.loop().runOnce(std::min(kAskAgain, std::chrono::duration<double>(end - Clock::now()).count()));
         if (Clock::now() >= end) return test();

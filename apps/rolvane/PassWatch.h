@@ -22,8 +22,8 @@ public:
     };
     std::function<void(const Event&)> onEvent; // on this thread, while it waits
 
-    // Waits until the test holds: it is asked at once, after every event, and twice a second, as an event may have been
-    // missed. False when the time ran out.
+    // Waits until the test holds: it is asked at once, when a pass has started or stopped, and twice a second, as an
+    // event may have been missed. False when the time ran out.
     bool waitUntil(const std::function<bool()>& test, double seconds);
 
     int started() const { return _started; }

@@ -19,6 +19,7 @@ namespace {
 using Json = nlohmann::ordered_json;
 
 constexpr const char* kSubscriptionListChanged = "CXSubscriptionListChanged";
+constexpr double kEndOfPassSeconds = 3;
 constexpr int kForbidden = 403;
 constexpr int kMissing = 404;
 
@@ -92,12 +93,15 @@ void waitForPeople(Context& context, PassWatch& watch, const RemoteLocation& loc
     CXRolvane& database = context.database();
     const std::string user = publisherOf(location);
     waitForPass(context, watch, "Fetching", position, saved, seconds);
-    // The pass may have begun before the subscription, or may have been ended in the middle by the restart.
     CXDAVError error;
     const auto missing = [&] {
         return database.findSubscriptionWithRemoteLocation(location) &&
                (!wasRead(Preferences::shared(), location) || pendingChanges() > 0);
     };
+    // What the daemon knows of the store is written down last in a pass.
+    const int stopped = watch.stopped();
+    watch.waitUntil([&] { return !missing() || watch.stopped() > stopped; }, std::min(seconds, kEndOfPassSeconds));
+    // The pass may have begun before the subscription, or may have been ended in the middle by the restart.
     for (int again = 0; again < 2 && missing() && CXDAVManager::canReachOstrelError(error); ++again)
         makePass(context, seconds);
     const CXSubscriptionRef subscription = database.findSubscriptionWithRemoteLocation(location);
