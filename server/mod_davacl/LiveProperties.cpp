@@ -1,7 +1,10 @@
 #include "server/mod_davacl/LiveProperties.h"
 
 #include "server/mod_davacl/Access.h"
+#include "server/mod_davacl/MembersTag.h"
 #include "server/mod_davacl/PrincipalResources.h"
+
+#include <string_view>
 
 namespace rolvane::davacl {
 namespace {
@@ -14,9 +17,11 @@ enum Property {
     kAclRestrictions,
     kInheritedAclSet,
     kPrincipalCollectionSet,
-    kCurrentUserPrincipal
+    kCurrentUserPrincipal,
+    kMembersTag
 };
-const char* const kNamespaces[] = {"DAV:", nullptr};
+const char* const kNamespaces[] = {"DAV:", kOwnNamespace, nullptr};
+constexpr int kOwn = 1; // the place of kOwnNamespace there
 const dav_liveprop_spec kProperties[] = {{0, "owner", kOwner, 0},
                                          {0, "supported-privilege-set", kSupportedPrivilegeSet, 0},
                                          {0, "current-user-privilege-set", kCurrentUserPrivilegeSet, 0},
@@ -25,6 +30,7 @@ const dav_liveprop_spec kProperties[] = {{0, "owner", kOwner, 0},
                                          {0, "inherited-acl-set", kInheritedAclSet, 0},
                                          {0, "principal-collection-set", kPrincipalCollectionSet, 0},
                                          {0, "current-user-principal", kCurrentUserPrincipal, 0},
+                                         {kOwn, kMembersTagName, kMembersTag, 0},
                                          {0, nullptr, 0, 0}};
 
 request_rec* requestOf(const dav_resource* resource) {
@@ -75,6 +81,33 @@ std::string wholeList(const Asked& a) {
     return text;
 }
 
+// Whether what is served there are files, as mod_dav_fs has them.
+bool servesFiles(request_rec* r) {
+    const char* provider = dav_get_provider_name(r);
+    return provider && std::string_view(provider) == "filesystem";
+}
+
+std::string_view withoutSlash(std::string_view path) {
+    return path.substr(0, path.find_last_not_of('/') + 1);
+}
+
+// The directory that a collection is, below or at the one that the request names.
+std::optional<std::string> directoryOf(request_rec* r, const dav_resource* resource) {
+    const std::string_view asked = withoutSlash(r->uri), path = withoutSlash(resource->uri);
+    if (!r->filename || !servesFiles(r) || !path.starts_with(asked)) return std::nullopt;
+    const std::string_view below = path.substr(asked.size());
+    if (!below.empty() && below.front() != '/') return std::nullopt;
+    return std::string(withoutSlash(r->filename)) + std::string(below);
+}
+
+std::optional<std::string> tagOf(const Asked& a, const dav_resource* resource) {
+    if (!resource->collection || !resource->exists || !(privilegesOn(a.r, a.c, a.place) & kRead)) return std::nullopt;
+    const auto directory = directoryOf(a.r, resource);
+    timespec now{};
+    clock_gettime(CLOCK_REALTIME, &now);
+    return directory ? membersTag(*directory, int64_t{now.tv_sec} * 1000000000 + now.tv_nsec) : std::nullopt;
+}
+
 // Nothing: not defined there, or not for this user.
 std::optional<std::string> valueOf(const Asked& a, int property) {
     const unsigned mine = privilegesOn(a.r, a.c, a.place);
@@ -112,14 +145,18 @@ dav_prop_insert insertProperty(const dav_resource* resource, int property, dav_p
         if (!place) return DAV_PROP_INSERT_NOTDEF;
         const dav_liveprop_spec* spec = nullptr;
         dav_get_liveprop_info(property, &kLiveProperties, &spec);
-        const std::string name = spec->name;
-        std::string out = "<D:" + name + "/>\n";
+        const bool own = spec->ns == kOwn;
+        const std::string name = (own ? "R:" : "D:") + std::string(spec->name);
+        const std::string start = name + (own ? std::string(" xmlns:R=\"") + kOwnNamespace + "\"" : std::string());
+        std::string out = "<" + start + "/>\n";
         if (what == DAV_PROP_INSERT_SUPPORTED)
-            out = "<D:supported-live-property D:name=\"" + name + "\" D:namespace=\"DAV:\"/>\n";
+            out = "<D:supported-live-property D:name=\"" + std::string(spec->name) + "\" D:namespace=\"" +
+                  kNamespaces[spec->ns] + "\"/>\n";
         if (what == DAV_PROP_INSERT_VALUE) {
-            const auto value = valueOf({r, *c, *place}, property);
+            const Asked asked{r, *c, *place};
+            const auto value = property == kMembersTag ? tagOf(asked, resource) : valueOf(asked, property);
             if (!value) return DAV_PROP_INSERT_NOTDEF;
-            out = "<D:" + name + ">" + *value + "</D:" + name + ">\n";
+            out = "<" + start + ">" + *value + "</" + name + ">\n";
         }
         apr_text_append(resource->pool, text, apr_pstrdup(resource->pool, out.c_str()));
         return what;
@@ -144,7 +181,9 @@ bool concerns(request_rec* r) {
 }
 
 dav_error* addToHeader(request_rec* r, const dav_resource*, apr_text_header* text) noexcept {
-    if (contained(r, false, [r] { return concerns(r); })) apr_text_append(r->pool, text, "access-control");
+    if (!contained(r, false, [r] { return concerns(r); })) return nullptr;
+    apr_text_append(r->pool, text, "access-control");
+    if (servesFiles(r)) apr_text_append(r->pool, text, kMembersTagClass);
     return nullptr;
 }
 

@@ -4,6 +4,12 @@
 
 namespace rolvane::davacl {
 
+// A property of our own: of a collection of files, its MembersTag. It is announced in the DAV header (RFC 4918 section
+// 10.1), because on a server that does not know it anybody could set a property of that name.
+inline constexpr const char* kOwnNamespace = "http://rolvane.net/ns/";
+inline constexpr const char* kMembersTagName = "members-tag";
+inline constexpr const char* kMembersTagClass = "<http://rolvane.net/ns/members-tag>";
+
 // The properties of RFC 3744 section 5 on everything below the base. They are no part of "allprop".
 extern const dav_liveprop_group kLiveProperties;
 int findLiveProperty(const dav_resource* resource, const char* space, const char* name,
@@ -11,7 +17,7 @@ int findLiveProperty(const dav_resource* resource, const char* space, const char
 void insertAllLiveProperties(request_rec* r, const dav_resource* resource, dav_prop_insert what,
                              apr_text_header* text) noexcept;
 
-// OPTIONS: "access-control" in the DAV header, ACL among the methods.
+// OPTIONS: "access-control" and the class above in the DAV header, ACL among the methods.
 extern const dav_options_provider kOptions;
 
 } // namespace rolvane::davacl

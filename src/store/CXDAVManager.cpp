@@ -182,7 +182,7 @@ bool CXDAVManager::createDirectoryAtAURL(const Url& url) {
 }
 
 std::optional<FileListing> CXDAVManager::infoForFilesInContainer(const Url& url) {
-    auto listing = StoreListing(_impl->session, _impl->versions).list(url);
+    auto listing = StoreListing(_impl->session, _impl->versions, _impl->listings).list(url);
     if (listing)
         for (const auto& [path, file] : *listing)
             if (file.seen && file.displayName.ends_with("CXGroup"))

@@ -18,6 +18,7 @@ struct CXDAVManager::Impl {
 
     LockTokens tokens;
     VersionMemory versions;
+    ListingMemory listings;
     StoreSession session;
     StoreFiles files;
     PublishStructure structure;

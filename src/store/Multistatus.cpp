@@ -8,6 +8,8 @@ namespace rolvane {
 
 namespace {
 
+constexpr std::string_view kMembersTag = "{http://rolvane.net/ns/}members-tag";
+
 std::string trimmed(const std::string& text) {
     const size_t first = text.find_first_not_of(" \t\r\n");
     if (first == std::string::npos) return {};
@@ -96,6 +98,7 @@ struct MultistatusReader::Impl : XmlSax {
         if (name == "getlastmodified") offered.lastModified = Date::fromHTTP(content);
         if (name == "getcontentlength") offered.length = parsedNumber(content);
         if (name == "getetag") offered.etag = EntityTag(content);
+        if (name == kMembersTag) offered.membersTag = content;
     }
 
     void takeOffered() {
@@ -103,6 +106,7 @@ struct MultistatusReader::Impl : XmlSax {
         if (offered.lastModified) entry.lastModified = offered.lastModified;
         if (offered.length) entry.length = offered.length;
         if (!offered.etag.empty()) entry.etag = offered.etag;
+        if (!offered.membersTag.empty()) entry.membersTag = offered.membersTag;
     }
 };
 

@@ -20,6 +20,7 @@ struct MultistatusEntry {
     std::optional<Date> lastModified;
     std::optional<uint64_t> length;
     EntityTag etag;
+    std::string membersTag; // of a collection, on a store that gives one (StoreSession::givesMembersTags)
 };
 
 struct MultistatusLimits {

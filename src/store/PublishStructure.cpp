@@ -37,7 +37,8 @@ std::vector<int> allBuckets() {
 // `everything`: the buckets are listed too, at the same time.
 PublishStructure::Missing PublishStructure::look(bool everything) {
     VersionMemory unused;
-    StoreListing listing(_session, unused);
+    ListingMemory none;
+    StoreListing listing(_session, unused, none);
     std::vector<Url> wanted{base()};
     if (everything) wanted.push_back(base().cxURLByAppendingComponent("People"));
     const auto found = listing.members(wanted);

@@ -43,14 +43,14 @@ bool isBaseLocation(const Url& name) {
 
 } // namespace
 
-std::vector<StoreListing::Members> StoreListing::members(const std::vector<Url>& containers) {
+std::vector<StoreListing::Members> StoreListing::members(const std::vector<Url>& containers, bool withMembersTags) {
     std::vector<std::shared_ptr<Staged>> staged;
     std::vector<HttpRequest> requests;
     std::vector<Members> out(containers.size());
     for (const Url& name : containers) {
         const auto url = _session.endpoint(name);
         if (!url) return out;
-        HttpRequest r = StoreSession::propfind(Url(asDirectory(*url)), 1);
+        HttpRequest r = StoreSession::propfind(Url(asDirectory(*url)), 1, withMembersTags);
         r.limits = {300, 60, kListingBytes, 64u << 10};
         auto reading = std::make_shared<Staged>();
         r.sink = [reading](std::string_view bytes) { return reading->sound = reading->reader.feed(bytes); };
@@ -86,12 +86,12 @@ std::vector<StoreListing::Members> StoreListing::members(const std::vector<Url>&
     return out;
 }
 
-void StoreListing::stamp(const Url& name, const MultistatusEntry& entry, const std::optional<Date>& serverDate,
+void StoreListing::stamp(std::string_view name, const MultistatusEntry& entry, const std::optional<Date>& serverDate,
                          FileInfo& info) {
     info.size = entry.length.value_or(0);
     info.etag = entry.etag;
     info.modificationdate = info.stored = entry.lastModified;
-    info.seen = _versions.knows(name.absoluteString(), {entry.etag, entry.lastModified, info.size});
+    info.seen = _versions.knows(name, {entry.etag, entry.lastModified, info.size});
     // Only with both dates is it known what "now" is to the server; its files may be dated ahead of its clock.
     if (!info.seen && entry.lastModified && serverDate)
         info.modificationdate = std::max(*entry.lastModified, *serverDate).addingSeconds(kUnseenSeconds);
@@ -105,7 +105,7 @@ bool StoreListing::addEntries(const Members& members, FileListing& out, std::vec
         info.isCollection = entry.isCollection;
         if (StoreFiles::isReservedName(info.displayName)) continue;
         if (!entry.isCollection)
-            stamp(name, entry, members.serverDate, info);
+            stamp(name.absoluteString(), entry, members.serverDate, info);
         else if (info.displayName.ends_with("CXGroup"))
             groupCollections.push_back(name);
         else
@@ -128,9 +128,52 @@ bool StoreListing::addStates(const std::vector<Url>& groups, FileListing& out) {
         if (answers[i].status != 207 || !reader.feed(answers[i].body)) return false;
         const auto entries = reader.finish();
         if (!entries || entries->size() != 1) return false;
-        stamp(groups[i], entries->front(), serverDateOf(answers[i]), out[pathOf(groups[i])]);
+        stamp(groups[i].absoluteString(), entries->front(), serverDateOf(answers[i]), out[pathOf(groups[i])]);
     }
     return true;
+}
+
+// The tags are told before the buckets are listed: what changes in between is in the listing already, and listed again
+// the next time.
+bool StoreListing::addBuckets(const Url& people, FileListing& out) {
+    const bool tagged = _session.givesMembersTags();
+    const auto level = members({people}, tagged);
+    if (!level.front().entries) return false;
+    std::vector<Url> none, names;
+    std::vector<std::string> tags;
+    for (const auto& [name, entry] : *level.front().entries) {
+        if (!entry.isCollection || StoreFiles::isReservedName(name.cxLastComponent())) continue;
+        const std::string tag = tagged ? entry.membersTag : std::string();
+        if (addUnchanged(name, tag, level.front().serverDate, out)) continue;
+        names.push_back(name);
+        tags.push_back(tag);
+    }
+    const auto buckets = members(names);
+    for (size_t i = 0; i < names.size(); ++i) {
+        if (!addEntries(buckets[i], out, none)) return false;
+        _listings.keep(names[i], tags[i], *buckets[i].entries);
+    }
+    return true;
+}
+
+bool StoreListing::addUnchanged(const Url& container, const std::string& tag, const std::optional<Date>& serverDate,
+                                FileListing& out) {
+    const std::string path = pathOf(container) + "/";
+    std::string url = container.absoluteString() + "/";
+    const size_t start = url.size();
+    return _listings.forEach(container, tag, [&](const ListingMemory::Member& member) {
+        FileInfo info;
+        info.displayName = Url::percentDecode(member.encodedName);
+        if (StoreFiles::isReservedName(info.displayName)) return;
+        info.isCollection = member.entry.isCollection;
+        url.resize(start);
+        url += member.encodedName;
+        if (info.isCollection)
+            info.modificationdate = member.entry.lastModified;
+        else
+            stamp(url, member.entry, serverDate, info);
+        out.insert_or_assign(path + info.displayName, std::move(info));
+    });
 }
 
 std::optional<FileListing> StoreListing::list(const Url& container) {
@@ -143,14 +186,7 @@ std::optional<FileListing> StoreListing::list(const Url& container) {
     const Url people = container.cxURLByAppendingComponent("People");
     const auto found = out.find(pathOf(people));
     if (found != out.end() && found->second.isCollection) {
-        FileListing buckets;
-        std::vector<Url> none, bucketNames;
-        const auto level = members({people});
-        if (!level.front().entries) return std::nullopt;
-        for (const auto& [name, entry] : *level.front().entries)
-            if (entry.isCollection && !StoreFiles::isReservedName(name.cxLastComponent())) bucketNames.push_back(name);
-        for (const Members& bucket : members(bucketNames))
-            if (!addEntries(bucket, out, none)) return std::nullopt;
+        if (!addBuckets(people, out)) return std::nullopt;
     }
     return addStates(groups, out) ? std::optional(std::move(out)) : std::nullopt;
 }

@@ -1,6 +1,7 @@
 #pragma once
 
 #include "store/CXFileManager.h"
+#include "store/ListingMemory.h"
 #include "store/Multistatus.h"
 #include "store/StoreSession.h"
 #include "store/VersionMemory.h"
@@ -10,10 +11,12 @@
 
 namespace rolvane {
 
-// Lists containers of a store, one PROPFIND of depth 1 a collection, in parallel. Complete or nothing. Any thread.
+// Lists containers of a store, one PROPFIND of depth 1 a collection, in parallel; of the buckets of a tree only those
+// whose tag says that they have changed since they were listed last. Complete or nothing. Any thread.
 class StoreListing {
 public:
-    StoreListing(StoreSession& session, VersionMemory& versions) : _session(session), _versions(versions) {}
+    StoreListing(StoreSession& session, VersionMemory& versions, ListingMemory& listings)
+        : _session(session), _versions(versions), _listings(listings) {}
 
     // How much later than the listing a version is dated that this client has neither read nor written: whoever
     // compares with the date of the last sync leaves a margin, and the version must lie behind that in this very
@@ -29,15 +32,20 @@ public:
         std::optional<std::vector<std::pair<Url, MultistatusEntry>>> entries; // by name; the container itself left out
         std::optional<Date> serverDate;
     };
-    std::vector<Members> members(const std::vector<Url>& containers);
+    std::vector<Members> members(const std::vector<Url>& containers, bool withMembersTags = false);
 
 private:
+    bool addBuckets(const Url& people, FileListing& out);
+    bool addUnchanged(const Url& container, const std::string& tag, const std::optional<Date>& serverDate,
+                      FileListing& out);
     bool addEntries(const Members& members, FileListing& out, std::vector<Url>& groupCollections);
     bool addStates(const std::vector<Url>& groups, FileListing& out);
-    void stamp(const Url& name, const MultistatusEntry& entry, const std::optional<Date>& serverDate, FileInfo& info);
+    void stamp(std::string_view name, const MultistatusEntry& entry, const std::optional<Date>& serverDate,
+               FileInfo& info);
 
     StoreSession& _session;
     VersionMemory& _versions;
+    ListingMemory& _listings;
 };
 
 } // namespace rolvane

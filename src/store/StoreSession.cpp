@@ -26,11 +26,19 @@ TransportCredentials::Scheme schemeOf(Authentication a) {
     return TransportCredentials::Scheme::automatic;
 }
 
-const std::shared_ptr<const std::string>& propfindBody() {
-    static const auto body = std::make_shared<const std::string>(
-        "<?xml version=\"1.0\" encoding=\"utf-8\"?>\n<propfind xmlns=\"DAV:\"><prop><resourcetype/><getlastmodified/>"
-        "<getcontentlength/><getetag/></prop></propfind>");
-    return body;
+constexpr std::string_view kMembersTagClass = "<http://rolvane.net/ns/members-tag>";
+
+std::shared_ptr<const std::string> makePropfindBody(const char* more) {
+    return std::make_shared<const std::string>(
+        std::string("<?xml version=\"1.0\" encoding=\"utf-8\"?>\n<propfind xmlns=\"DAV:\"><prop><resourcetype/>"
+                    "<getlastmodified/><getcontentlength/><getetag/>") +
+        more + "</prop></propfind>");
+}
+
+const std::shared_ptr<const std::string>& propfindBody(bool withMembersTags) {
+    static const auto plain = makePropfindBody("");
+    static const auto tags = makePropfindBody("<members-tag xmlns=\"http://rolvane.net/ns/\"/>");
+    return withMembersTags ? tags : plain;
 }
 
 } // namespace
@@ -81,10 +89,10 @@ HttpRequest StoreSession::request(std::string method, Url url) {
     return r;
 }
 
-HttpRequest StoreSession::propfind(Url url, int depth) {
+HttpRequest StoreSession::propfind(Url url, int depth, bool withMembersTags) {
     HttpRequest r = request("PROPFIND", std::move(url));
     r.headers = {{"Depth", std::to_string(depth)}, {"Content-Type", "application/xml; charset=utf-8"}};
-    r.body = propfindBody();
+    r.body = propfindBody(withMembersTags);
     return r;
 }
 
@@ -169,6 +177,7 @@ HttpResponse StoreSession::options() {
     if (answer.complete() && (answer.ok() || answer.status == 403 || answer.status == 404) && announcesDav1(answer)) {
         _davSeen = steadyMilliseconds();
         _accessLists = announcesDavClass(answer, "access-control") ? 1 : 0;
+        _membersTags = announcesDavClass(answer, kMembersTagClass);
     } else if (answer.status != 401) {
         _davSeen = 0;
     }

@@ -43,11 +43,14 @@ public:
     // Whether the server announces access lists (RFC 3744 section 7.2), as it last said; asked when it never did.
     // Nothing when it does not answer.
     std::optional<bool> keepsAccessLists();
+    // Whether the server tells the state of a collection's members by a tag, as it last said: a property of that name
+    // counts only where the server announces it, since elsewhere any writer could set it.
+    bool givesMembersTags() const { return _membersTags; }
     // The password; absent, and the failed-password handler called, when it cannot be had.
     std::optional<std::string> password();
 
     static HttpRequest request(std::string method, Url url);
-    static HttpRequest propfind(Url url, int depth);
+    static HttpRequest propfind(Url url, int depth, bool withMembersTags = false);
 
 private:
     bool signIn();
@@ -65,6 +68,7 @@ private:
     bool _loginRefused = false; // a 401 was seen: ask for the password anew
     bool _loginProven = false;  // a request that needs a login has succeeded
     std::atomic<bool> _signedIn{false};
+    std::atomic<bool> _membersTags{false};
     std::atomic<int> _accessLists{-1}; // 1 or 0 as the server announced it last, -1: it never answered
     std::atomic<int64_t> _davSeen{0}; // steady milliseconds when the server last proved to be a WebDAV server; 0: never
 };
