@@ -115,14 +115,9 @@ size_t pendingFor(Preferences& preferences, const RemoteLocation& location) {
 }
 
 void forgetSubscription(Preferences& preferences, const RemoteLocation& location, const UniqueId& subscription) {
-    const UserName user(publisherOf(location));
     EngineState state(preferences);
-    for (const char* conduit : {kConduitCX, kConduitVaultra})
-        state.conduitObjectForKey(conduit, kPriorState).remove(user.str());
+    state.forgetUser(UserName(publisherOf(location)));
     state.removeSubscription(subscription);
-    CXDChangeRecords waiting = state.getPendingChanges();
-    if (std::erase_if(waiting, [&](const CXDChangeRecordPtr& record) { return record->user() == user; }) > 0)
-        state.setPendingChanges(waiting);
     state.syncPrefs();
 }
 

@@ -209,6 +209,7 @@ void CXDCXConduit::captureDeleted(ChangeCapture& capture, const Array& identifie
     lookForRevokedSubscriptions(deleted);
     const RemovalChanges removals(priorState(), deleted.size());
     for (const UniqueId& identifier : deleted) {
+        if (rolvane().recordForUniqueId(identifier)) continue; // it is here again: another subscription brought it
         const UniqueId normalized = cxNormalizedUID(identifier);
         if (normalized.endsWith(kCXGroupTable))
             capture.add(removals.changesToRemoveGroup(normalized));

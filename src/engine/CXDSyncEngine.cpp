@@ -172,6 +172,9 @@ void CXDSyncEngine::bringSourcesUpToDateAndAllowRetry(bool allowRetry) {
         checkCXShareCount();
         _parts->state.dropConduitData();
         _parts->state.conduitData();
+        // What was revoked before is forgotten already; what is subscribed to again is not revoked.
+        _parts->revoked.clear();
+        forgetFormerSubscriptions(*_parts);
         _parts->with.progress.startedPhase(1);
         CXDChangeRecords gathered = gather();
         // Nothing has been changed yet, and the next process finds the same again.

@@ -95,9 +95,23 @@ void updateStateAndExitIfNeeded(EngineParts& parts) {
         parts.state.syncPrefs();
     }
     removeCacheDataForConduit(parts, *parts.conduits.vaultra);
+    forgetFormerSubscriptions(parts);
     if (save) rolvane.save();
     // Two, not one: an owner who publishes nothing and has one subscription (the built-in one) is not served.
     if (!publishes && subscriptions < 2) killCXD(parts);
+}
+
+void forgetFormerSubscriptions(EngineParts& parts) {
+    for (const CXSubscriptionRef& subscription : parts.with.rolvane.subscriptions()) {
+        const RemoteLocation location = subscription->remoteLocation();
+        if (!parts.state.isOfFormerSubscription(location, subscription->uniqueId())) continue;
+        const auto user = userForRemoteLocation(location, parts.with.account.vaultraUser(), parts.with.loginName);
+        if (!user || user == kSelf) continue;
+        CXDLog("Forgetting what came by a former subscription to %@", location);
+        parts.state.forgetUser(*user);
+        parts.state.removeSubscriptionMapForRemoteLocation(location);
+        parts.state.syncPrefs();
+    }
 }
 
 void removeCacheDataForConduit(EngineParts& parts, CXDConduit& conduit) {

@@ -42,6 +42,10 @@ void checkCXShareCount(EngineParts& parts);
 // updateStateAndExitIfNeeded: without an account no remote subscription and no publication are left; with nothing
 // published and fewer than two subscriptions the process ends.
 void updateStateAndExitIfNeeded(EngineParts& parts);
+// A subscription that ended and was made anew between two looks has a new identifier. What is remembered of its
+// location belongs to the former one, whose copies are gone: compared with it, their absence would be carried to the
+// publisher's store as removals. It is forgotten, and everything comes again.
+void forgetFormerSubscriptions(EngineParts& parts);
 // removeCacheDataForConduit:. Forgets users of the conduit to whom there is no subscription any more.
 void removeCacheDataForConduit(EngineParts& parts, CXDConduit& conduit);
 

@@ -3,7 +3,10 @@
 #include "foundation/CXException.h"
 #include "foundation/KeyedArchive.h"
 #include "foundation/Log.h"
+#include "model/PayloadKeys.h"
+#include "model/RemoteLocationMap.h"
 
+#include <algorithm>
 #include <map>
 #include <utility>
 
@@ -123,6 +126,23 @@ void EngineState::removeSubscription(const UniqueId& subscription) {
     const std::lock_guard guard(_lock);
     const Value map = loadedConduitData()[kSubscriptionMap];
     if (map.isDictionary()) map.dictionary().remove(subscription.str());
+}
+
+bool EngineState::isOfFormerSubscription(const RemoteLocation& location, const UniqueId& subscription) {
+    const std::lock_guard guard(_lock);
+    const Value map = loadedConduitData()[kSubscriptionMap];
+    const Dictionary* locations = map.dictionaryIf();
+    if (!locations || locations->contains(subscription.str())) return false;
+    return std::any_of(locations->begin(), locations->end(),
+                       [&](const auto& entry) { return entry.second == Value(location); });
+}
+
+void EngineState::forgetUser(const UserName& user) {
+    for (const char* conduit : {kConduitVaultra, kConduitCX})
+        conduitObjectForKey(conduit, kPriorState).remove(user.str());
+    CXDChangeRecords pending = getPendingChanges();
+    if (std::erase_if(pending, [&](const CXDChangeRecordPtr& r) { return r->user() == user; }) > 0)
+        setPendingChanges(pending);
 }
 
 void EngineState::reset() {

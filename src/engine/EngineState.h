@@ -54,6 +54,10 @@ public:
     std::optional<RemoteLocation> remoteLocationForSubscriptionUID(const UniqueId& subscription);
     void removeSubscriptionMapForRemoteLocation(const RemoteLocation& location); // every subscription to it
     void removeSubscription(const UniqueId& subscription);
+    // Is what is remembered of the location known by other subscriptions only?
+    bool isOfFormerSubscription(const RemoteLocation& location, const UniqueId& subscription);
+    // What both conduits remember of the user, and the user's changes in the queue (durably). Nothing else is written.
+    void forgetUser(const UserName& user);
 
     void reset(); // forgets everything, durably
     Preferences& preferences() const { return _preferences; }

@@ -1,8 +1,6 @@
 #include "engine/Revocation.h"
 
 #include "engine/EngineState.h"
-#include "model/PayloadKeys.h"
-#include "model/RemoteLocationMap.h"
 
 namespace rolvane {
 
@@ -13,13 +11,8 @@ void Revocation::revoke(EngineState& state, const RemoteLocation& location, cons
         _locations.push_back(location);
         _known.insert(location);
     }
-    state.conduitObjectForKey(kConduitVaultra, kPriorState).remove(user.str());
-    state.conduitObjectForKey(kConduitCX, kPriorState).remove(user.str());
+    state.forgetUser(user);
     if (subscription) state.removeSubscription(*subscription);
-
-    CXDChangeRecords pending = state.getPendingChanges();
-    const size_t removed = std::erase_if(pending, [&](const CXDChangeRecordPtr& r) { return r->user() == user; });
-    if (removed) state.setPendingChanges(pending);
 }
 
 bool Revocation::contains(const RemoteLocation& location) const {
