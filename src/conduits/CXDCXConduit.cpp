@@ -138,16 +138,22 @@ bool CXDCXConduit::saysSomething(const CXSubscription& subscription) const {
     return group && (group->memberCount() > 0 || !group->subgroupUniqueIds().empty());
 }
 
-// Groups that a former pass may have left on the store in an older state. (All-contacts groups are compared anyway.)
+// Groups that a former pass may have left on the store in an older state, or left there although they are gone.
+// (All-contacts groups are compared anyway.)
 void CXDCXConduit::addUnsettledGroups(ChangeCapture& capture) {
     const Dictionary unsettled = engine().conduitObjectForKey(kConduitCX, kUnsettledGroups);
     engine().setConduitObjectForKey(kConduitCX, Dictionary(), kUnsettledGroups);
-    for (const auto& [identifier, isSo] : unsettled)
+    for (const auto& [identifier, isSo] : unsettled) {
+        bool isThere = identifier == kCXAllGroupUID;
         for (const std::string_view table : {kCXGroupTable, kCXSubscribedGroupTable}) {
             const UniqueId uid = cxUIDWithTableName(UniqueId(identifier), table);
-            if (const auto group = std::dynamic_pointer_cast<CXGroup>(rolvane().recordForUniqueId(uid)))
+            if (const auto group = std::dynamic_pointer_cast<CXGroup>(rolvane().recordForUniqueId(uid))) {
                 capture.addGroup(group);
+                isThere = true;
+            }
         }
+        if (!isThere) capture.add(changesToRemoveGroup(cxUIDWithTableName(UniqueId(identifier), kCXGroupTable)));
+    }
 }
 
 // -- other processes' saves

@@ -129,7 +129,9 @@ void ApplyLoop::applyAll(bool trickle) {
 void ApplyLoop::queue() {
     CXDChangeRecords accepted = mingled(_unhandled);
     CXDLog("Mingled: %@", accepted);
-    CXDChangeRecords flat = flattenGroupChanges(accepted);
+    std::unordered_set<UniqueId> lossy;
+    CXDChangeRecords flat = flattenGroupChanges(accepted, &lossy);
+    for (const UniqueId& group : lossy) _unsettled.set(group.str(), true);
     sortByType(flat);
     _totalCount = flat.size();
     _processedCount = 0;

@@ -53,7 +53,7 @@ private:
     bool _queueTaken = false;    // the stored queue is part of the pass
     bool _queueStored = false;
     CXDChangeRecords _pendingChanges;
-    Dictionary _unsettled; // groups whose changes may have been applied in another order than they were made
+    Dictionary _unsettled; // groups whose changes may have been lost, or applied in another order than they were made
     CXDChangeRecords _inOrder;
     size_t _inOrderDone = 0;
     std::unique_ptr<OutOfOrderWork> _outOfOrder;

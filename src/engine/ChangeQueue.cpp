@@ -66,6 +66,17 @@ bool startsFold(Part& part) {
     }
 }
 
+// What a composite that takes the record in still says of it: nothing.
+bool isLostInFold(const CXDChangeRecord& record) {
+    switch (record.type()) {
+    case CXDCompositeGroupChange:
+    case CXDChangeGroupReadACL:
+    case CXDChangeGroupReadWriteACL:
+    case CXDDeleteGroup: return record.initialSource() == CXDSyncSourceCX;
+    default: return false;
+    }
+}
+
 std::vector<Part> split(const CXDChangeRecords& records) {
     std::vector<Part> work;
     work.reserve(records.size());
@@ -94,7 +105,7 @@ CXDChangeRecordPtr compositeFor(Part& part) {
 
 } // namespace
 
-CXDChangeRecords flattenGroupChanges(const CXDChangeRecords& records) {
+CXDChangeRecords flattenGroupChanges(const CXDChangeRecords& records, std::unordered_set<UniqueId>* lossy) {
     std::vector<Part> work = split(records);
     std::unordered_map<UniqueId, std::vector<uint32_t>> placesOfGroup; // ascending
     for (size_t i = 0; i < work.size(); ++i)
@@ -120,6 +131,7 @@ CXDChangeRecords flattenGroupChanges(const CXDChangeRecords& records) {
                 kept.push_back(places.back());
                 continue;
             }
+            if (lossy && isLostInFold(earlier.content())) lossy->insert(*composite->group());
             composite->mergeWithGroupChangeRecord(earlier.content());
             earlier.fold();
         }

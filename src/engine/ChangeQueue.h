@@ -2,6 +2,8 @@
 
 #include "model/CXDChangeRecord.h"
 
+#include <unordered_set>
+
 namespace rolvane {
 
 // The group identifier that stands for all contacts; its changes are never folded.
@@ -13,7 +15,11 @@ inline const UniqueId kPeopleGroup{"People"};
 // A fold starts at a change that is addressed to something other than the contact database alone and is no composite,
 // access-list change or deletion; it then takes in every earlier change of that group, whatever its type and sources.
 // What merging refuses (CXDChangeRecord::canBeMerged, or a payload that cannot be read) stands for itself.
-CXDChangeRecords flattenGroupChanges(const CXDChangeRecords& records);
+//
+// A composite cannot say everything: access-list changes, deletions and earlier composites that a fold takes in are
+// gone, and a deletion takes along what the fold has taken in before. `lossy` (may be null) gets the groups where that
+// befell a change from the contact database.
+CXDChangeRecords flattenGroupChanges(const CXDChangeRecords& records, std::unordered_set<UniqueId>* lossy = nullptr);
 
 // Sorts by CXDChangeRecord::compare; equal ones keep their order. O(C).
 void sortByType(CXDChangeRecords& records);

@@ -21,7 +21,8 @@ inline constexpr const char* kDistributionListState = "distributionListState"; /
 
 // Where a conduit's prior state stands in its data: user to group identifier to group state.
 inline constexpr const char* kPriorState = "priorState";
-// Beside it, for the contact database: identifier -> true, groups that the next scan compares whatever their date.
+// Beside it, for the contact database: identifier -> true, groups that the next scan compares whatever their date, or
+// withdraws when they are gone.
 inline constexpr const char* kUnsettledGroups = "unsettledGroups";
 // And: owner marker -> false when the owner's published tree has lost what it held, so that the next scan takes
 // everything for new; true from that scan on until all of it is written.

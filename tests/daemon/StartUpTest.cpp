@@ -262,6 +262,67 @@ TEST_F(StartUp, AGroupsChangeThatWaitedDoesNotOutliveALaterOne) {
     EXPECT_EQ(world.differences(), "") << daemon->errors();
 }
 
+// The group's file and directory are gone, and everything else is as it is in the database.
+void expectNoTraceOfGroupA(DaemonWorld& world, ChildProcess& daemon) {
+    const auto traces = [&] {
+        std::string found;
+        for (const std::string& file : world.tree())
+            if (file.starts_with("A:CXGroup")) found += file + "\n";
+        return found + world.differences();
+    };
+    const auto settled = [&] { return world.pendingChanges() == 0 && traces().empty(); };
+    for (int i = 0; i < 200 && !settled(); ++i) daemon.wait(0.05);
+    EXPECT_EQ(world.pendingChanges(), 0U) << daemon.errors();
+    EXPECT_EQ(traces(), "") << daemon.errors();
+}
+
+TEST_F(StartUp, AGroupDeletedWithItsMembersInOneSaveLeavesTheStore) {
+    const auto daemon = servingGroups(world);
+    ASSERT_EQ(world.differences(), "") << daemon->errors();
+    const CXGroupRef a = groupNamed(world, "A:CXGroup");
+    const auto members = a->members();
+    world.database().removeRecord(a);
+    world.database().removeRecord(members[0]);
+    world.database().removeRecord(members[1]);
+    world.database().save();
+    expectNoTraceOfGroupA(world, *daemon);
+}
+
+TEST_F(StartUp, AGroupDeletedWhileAnOlderChangeOfItWaitsLeavesTheStore) {
+    const auto daemon = servingGroups(world);
+    ASSERT_EQ(world.differences(), "") << daemon->errors();
+    world.store().stop(PrivateStore::Stop::atOnce);
+    const CXGroupRef a = groupNamed(world, "A:CXGroup");
+    a->setValue("Renamed", kCXGroupNameProperty);
+    world.database().save();
+    for (int i = 0; i < 600 && world.pendingChanges() == 0; ++i) daemon->wait(0.05);
+    ASSERT_GT(world.pendingChanges(), 0U) << daemon->errors();
+
+    world.store().start();
+    world.database().removeRecord(a);
+    world.database().save();
+    expectNoTraceOfGroupA(world, *daemon);
+}
+
+TEST_F(StartUp, AContactDeletedWhileAnOlderEditOfItWaitsLeavesTheStore) {
+    const auto daemon = servingGroups(world);
+    ASSERT_EQ(world.differences(), "") << daemon->errors();
+    world.store().stop(PrivateStore::Stop::atOnce);
+    const CXPersonRef person = world.database().allGroup()->members()[0];
+    person->setValue("an edit", kCXNoteProperty);
+    world.database().save();
+    for (int i = 0; i < 600 && world.pendingChanges() == 0; ++i) daemon->wait(0.05);
+    ASSERT_GT(world.pendingChanges(), 0U) << daemon->errors();
+
+    world.store().start();
+    world.database().removeRecord(person);
+    world.database().save();
+    const auto settled = [&] { return world.pendingChanges() == 0 && world.differences().empty(); };
+    for (int i = 0; i < 200 && !settled(); ++i) daemon->wait(0.05);
+    EXPECT_EQ(world.pendingChanges(), 0U) << daemon->errors();
+    EXPECT_EQ(world.differences(), "") << daemon->errors();
+}
+
 TEST_F(StartUp, AnEditOfAnotherProcessIsCarriedToTheStore) {
     world.bus();
     world.addPeople(2);

@@ -324,6 +324,16 @@ TEST_F(Pass, ADeniedChangeIsDroppedCancelsItsUsersOthersAndIsRetriedOnce) {
     EXPECT_EQ(world.events.count("CXDCX gather"), 1u) << "a retry schedules no other";
 }
 
+TEST_F(Pass, AGroupOfWhichAChangeGotLostInAFoldIsComparedOnceMore) {
+    const Dictionary writer{{"additions", Array{"bob"}}, {"deletions", Array()}};
+    trickle({makeRecord(CXDChangeGroupReadWriteACL, nullptr, "G1", {}, writer),
+             makeRecord(CXDAddRecordToGroup, "P1", "G1"), makeRecord(CXDAddRecordToGroup, "P1", "G2")});
+    const Dictionary unsettled = world.engine->conduitObjectForKey("CXDCX", "unsettledGroups");
+    EXPECT_EQ(unsettled.allKeys(), Strings{"G1"});
+    world.turn();
+    EXPECT_EQ(world.events.count("CXDCX gather"), 1U);
+}
+
 TEST_F(Pass, WithoutRetryTheDeniedSetIsEmptiedAllTheSame) {
     world.vaultra->whenApplying = [](const CXDChangeRecordPtr&, bool* denied) {
         *denied = true;

@@ -124,6 +124,23 @@ TEST(Flattening, WhatCannotBeMergedStandsForItselfAndStopsNobody) {
     EXPECT_EQ(flat[1]->type(), CXDCompositeGroupChange);
 }
 
+TEST(Flattening, NamesTheGroupsOfWhichAFoldLosesAChange) {
+    for (const int32_t lost : {3, 7, 8, 261}) {
+        std::unordered_set<UniqueId> lossy;
+        const CXDChangeRecords flat = flattenGroupChanges(
+            {makeRecord(lost, nullptr, "G1"), makeRecord(CXDRemoveRecordFromGroup, "P1", "G1"),
+             makeRecord(CXDAddRecordToGroup, "P1", "G2"), makeRecord(CXDAddRecordToGroup, "P2", "G2")},
+            &lossy);
+        EXPECT_EQ(flat.size(), 2u);
+        EXPECT_EQ(lossy, std::unordered_set<UniqueId>{UniqueId("G1")}) << lost;
+
+        lossy.clear(); // what comes last stands for itself
+        flattenGroupChanges({makeRecord(CXDRemoveRecordFromGroup, "P1", "G1"), makeRecord(lost, nullptr, "G1")},
+                            &lossy);
+        EXPECT_TRUE(lossy.empty()) << lost;
+    }
+}
+
 TEST(Flattening, APayloadThatCannotBeReadStandsForItself) {
     const test::LogCapture log(0);
     const auto damaged = makeRecord(CXDChangeGroupName, nullptr, "G1");
