@@ -108,7 +108,7 @@ public:
 
 private:
     std::unique_ptr<CXDSyncEngine> makeEngine() {
-        CXDAVManager& store = CXDAVManager::defaultManager();
+        CXDAVManager& store = storeOfTheAccount();
         termination().store = &store;
         CXNetworkController::sharedNetworkController().startMonitoring(_loop, NotificationCenter::defaultCenter());
         _account = makeStoreNetworkAccount();
@@ -120,6 +120,17 @@ private:
         termination().engine = engine.get();
         if (termination().asked) termination().ask(); // it came while the engine was being made
         return engine;
+    }
+
+    // An account that is there and cannot be used is not the same as none: without one, publication and subscriptions
+    // leave the database.
+    static CXDAVManager& storeOfTheAccount() {
+        const auto saved = CXDAVAccount::load(); // throws for one that cannot be used
+        CXDAVManager& store = CXDAVManager::defaultManager();
+        if (saved && store.account().user.empty())
+            throw CXException(kCXNetworkException, "The account in " + CXDAVAccount::defaultPath() +
+                                                       " could be read once, but not again. Start once more.");
+        return store;
     }
 
     EngineConduits makeConduits(ConduitEngine& engine, CXDAVManager& store) {

@@ -162,6 +162,26 @@ TEST_F(StartUp, AnErrorThatReachesTheRunLoopEndsItWithOneLineAndStatusZeroAndLos
     EXPECT_EQ(world.differences(), "") << next->errors();
 }
 
+// Taken for no account, it would end the publication and every subscription, in the database and for good.
+TEST_F(StartUp, AnAccountThatIsThereButCannotBeUsedEndsItAndTakesNothingAway) {
+    world.addPeople(1);
+    world.subscribeFarAway();
+    world.publishEverything();
+    const std::string path = CXDAVAccount::defaultPath(), good = readFile(path);
+    const auto with = [&](const char* from, const std::string& to) {
+        std::string text = good;
+        return text.replace(text.find(from), std::string_view(from).size(), to);
+    };
+    for (const std::string& bad :
+         {good.substr(0, good.size() / 2), with("https:", "gopher:"), with("automatic", "x")}) {
+        std::ofstream(path) << bad;
+        world.closeDatabase();
+        endsWithOneLineAbout(world, path);
+        EXPECT_TRUE(world.database().allGroup()->valueForProperty(kCXRemoteLocationProperty));
+        EXPECT_EQ(world.database().subscriptions().size(), 2U);
+    }
+}
+
 TEST_F(StartUp, APasswordThatCannotBeHadEndsItWithStatusZero) {
     world.addPeople(1);
     world.saveAccountOn(world.store());
