@@ -5,8 +5,10 @@
 
 #include <algorithm>
 #include <cstdint>
+#include <functional>
 #include <iterator>
 #include <map>
+#include <optional>
 #include <unordered_map>
 #include <vector>
 
@@ -66,6 +68,21 @@ bool startsFold(Part& part) {
     }
 }
 
+// Whose group: every user has an all-contacts group, and all are called the same.
+struct GroupOfUser {
+    explicit GroupOfUser(const CXDChangeRecord& record) : group(*record.group()), user(record.user()) {}
+    bool operator==(const GroupOfUser&) const = default;
+
+    UniqueId group;
+    std::optional<UserName> user;
+};
+
+struct GroupOfUserHash {
+    size_t operator()(const GroupOfUser& of) const {
+        return std::hash<UniqueId>{}(of.group) * 31 + (of.user ? std::hash<UserName>{}(*of.user) : 0);
+    }
+};
+
 // What a composite that takes the record in still says of it: nothing.
 bool isLostInFold(const CXDChangeRecord& record) {
     switch (record.type()) {
@@ -107,10 +124,10 @@ CXDChangeRecordPtr compositeFor(Part& part) {
 
 CXDChangeRecords flattenGroupChanges(const CXDChangeRecords& records, std::unordered_set<UniqueId>* lossy) {
     std::vector<Part> work = split(records);
-    std::unordered_map<UniqueId, std::vector<uint32_t>> placesOfGroup; // ascending
+    std::unordered_map<GroupOfUser, std::vector<uint32_t>, GroupOfUserHash> placesOfGroup; // ascending
     for (size_t i = 0; i < work.size(); ++i)
         if (isGroupChange(work[i].content()))
-            placesOfGroup[*work[i].content().group()].push_back(static_cast<uint32_t>(i));
+            placesOfGroup[GroupOfUser(work[i].content())].push_back(static_cast<uint32_t>(i));
 
     CXDChangeRecords flat; // from the back to the front
     for (size_t i = work.size(); i-- > 0;) {
@@ -121,7 +138,7 @@ CXDChangeRecords flattenGroupChanges(const CXDChangeRecords& records, std::unord
         }
         const CXDChangeRecordPtr composite = compositeFor(work[i]);
         composite->mergeWithGroupChangeRecord(work[i].content());
-        std::vector<uint32_t>& places = placesOfGroup[*composite->group()];
+        std::vector<uint32_t>& places = placesOfGroup[GroupOfUser(*composite)];
         work[i].fold();
         std::vector<uint32_t> kept;
         for (; !places.empty(); places.pop_back()) {

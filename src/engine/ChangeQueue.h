@@ -9,8 +9,8 @@ namespace rolvane {
 // The group identifier that stands for all contacts; its changes are never folded.
 inline const UniqueId kPeopleGroup{"People"};
 
-// Splits group changes into one record a source and folds the changes of one group into one composite, which takes the
-// place of the group's last change. O(C) expected.
+// Splits group changes into one record a source and folds the changes of one user's group into one composite, which
+// takes the place of the group's last change. O(C) expected.
 //
 // A fold starts at a change that is addressed to something other than the contact database alone and is no composite,
 // access-list change or deletion; it then takes in every earlier change of that group, whatever its type and sources.

@@ -37,7 +37,8 @@ CXDChangeRecords literalFlat(const CXDChangeRecords& input) {
         c->mergeWithGroupChangeRecord(*x);
         result.insert(result.begin(), c);
         for (size_t i = work.size(); i-- > 0;) {
-            if (work[i]->group() != x->group() || !work[i]->canBeMerged()) continue;
+            const bool same = work[i]->group() == x->group() && work[i]->user() == x->user();
+            if (!same || !work[i]->canBeMerged()) continue;
             c->mergeWithGroupChangeRecord(*work[i]);
             work.erase(work.begin() + static_cast<std::ptrdiff_t>(i));
         }
@@ -94,13 +95,27 @@ TEST(Flattening, AccessListChangesDeletionsAndCompositesStartNoFold) {
 
 TEST(Flattening, AFoldTakesInEveryEarlierChangeOfItsGroupWhateverItsTypeAndSources) {
     const CXDChangeRecords flat = flattenGroupChanges({
-        makeRecord(CXDAddRecordToGroup, "P1", "G1", {4, 1, "ann"}),
+        makeRecord(CXDAddRecordToGroup, "P1", "G1", {4, 1, "<self>"}),
         makeRecord(CXDChangeGroupReadACL, nullptr, "G1"),
         makeRecord(CXDAddRecordToGroup, "P2", "G1"),
     });
     ASSERT_EQ(flat.size(), 1u);
     EXPECT_EQ(flat[0]->appliesToSources(), CXDSyncSourceVaultra);
     EXPECT_EQ(flat[0]->inMemoryPayload(), Value(Dictionary{{"memberAdds", Array{"P2", "P1"}}}));
+}
+
+// Every user has an all-contacts group, and all are called the same.
+TEST(Flattening, TheChangesOfTwoUsersGroupsOfOneNameAreNotMixed) {
+    const CXDChangeRecords flat =
+        flattenGroupChanges({makeRecord(CXDAddRecordToGroup, "P1", "AllCXGroup", {1, 4, "bob"}),
+                             makeRecord(CXDAddRecordToGroup, "P2", "AllCXGroup", {4, 1, "carol"}),
+                             makeRecord(CXDAddRecordToGroup, "P3", "AllCXGroup", {1, 4, "<self>"})});
+    ASSERT_EQ(flat.size(), 3u);
+    EXPECT_EQ(flat[0]->user(), UserName("bob"));
+    EXPECT_EQ(flat[0]->inMemoryPayload(), Value(Dictionary{{"memberAdds", Array{"P1"}}}));
+    EXPECT_EQ(flat[1]->type(), CXDAddRecordToGroup);
+    EXPECT_EQ(flat[2]->user(), kSelf);
+    EXPECT_EQ(flat[2]->inMemoryPayload(), Value(Dictionary{{"memberAdds", Array{"P3"}}}));
 }
 
 TEST(Flattening, AChangeOfAllContactsPassesUnchangedWithAllItsSources) {
