@@ -124,6 +124,7 @@ void forgetPublication(Preferences& preferences) {
     EngineState state(preferences);
     for (const char* conduit : {kConduitCX, kConduitVaultra})
         state.conduitObjectForKey(conduit, "priorState").remove(kSelf.str());
+    preferences.remove(kDaemonDomain, kCXDUnsavedAccessLists);
     dropPending(state, [](const CXDChangeRecord& record) { return record.changeMadeByDataOwner(); });
     state.syncPrefs();
 }

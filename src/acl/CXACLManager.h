@@ -2,6 +2,7 @@
 
 #include "foundation/StrongString.h"
 #include "foundation/Url.h"
+#include "foundation/Value.h"
 
 #include <string>
 #include <vector>
@@ -27,6 +28,10 @@ public:
     virtual bool load();     // base: false, nothing loaded
     virtual bool validate(); // base: true
     virtual bool save();     // base: what validate says
+    // The changes that no save has carried yet, in their order, each a dictionary. What another process could not save
+    // is gone on with by `resume`. Base: nothing is kept.
+    virtual Array unsaved() const { return {}; }
+    virtual void resume(const Array& /*changes*/) {}
     // Whether the lists say what is kept, so that they may be compared; base: true.
     virtual bool isKnown() const { return true; }
 
@@ -61,6 +66,7 @@ protected:
         bool allAccess;
         bool grant;
         bool oneListOnly;
+        bool operator==(const Change&) const = default;
     };
     // Called for each change before it is carried out, whether it changes a list or not.
     virtual void willChange(const Change& /*change*/) {}

@@ -7,12 +7,13 @@
 
 #include <algorithm>
 #include <functional>
-#include <utility>
 
 namespace rolvane {
 namespace {
 
 constexpr const char* kAllGroup = "AllCXGroup"; // what a subscriber's rights are asked about
+constexpr const char *kPrincipal = "principal", *kAllAccess = "allAccess", *kGrant = "grant",
+                     *kOneListOnly = "oneListOnly";
 constexpr std::string_view kPrivilegeSet = "current-user-privilege-set";
 constexpr std::string_view kResourceSet = "access-control-resource-set";
 
@@ -159,8 +160,32 @@ bool CXDAVACLManager::publisherLoadResourceSet() {
     return root && resourcesIn(*root, _baseLocation);
 }
 
+// A change that is asked for again undoes what came between, so that the earlier one makes no difference any more.
 void CXDAVACLManager::willChange(const Change& change) {
-    if (_publisher && !_loaded) _unseen.push_back(change);
+    if (!_publisher) return;
+    std::erase(_unsaved, change);
+    _unsaved.push_back(change);
+}
+
+Array CXDAVACLManager::unsaved() const {
+    Array all;
+    for (const Change& change : _unsaved)
+        all.append(Dictionary{{kPrincipal, change.principal},
+                              {kAllAccess, change.allAccess},
+                              {kGrant, change.grant},
+                              {kOneListOnly, change.oneListOnly}});
+    return all;
+}
+
+void CXDAVACLManager::resume(const Array& changes) {
+    for (const Value& each : changes) {
+        const Dictionary stored = each.dictionary();
+        const Change change{UserName(stored[kPrincipal].string()), stored[kAllAccess].boolean(),
+                            stored[kGrant].boolean(), stored[kOneListOnly].boolean()};
+        if (change.principal.empty()) continue;
+        willChange(change);
+        carryOut(change);
+    }
 }
 
 bool CXDAVACLManager::save() {
@@ -173,11 +198,14 @@ bool CXDAVACLManager::saveSimpleACL() {
     if (!_publisher) return true;
     try {
         if (!_loaded) {
-            if (_unseen.empty() || !load()) return false;
-            for (const Change& change : std::exchange(_unseen, {})) carryOut(change);
+            if (_unsaved.empty() || !load()) return false;
+            for (const Change& change : _unsaved) carryOut(change);
         }
-        return _manager.setACLsWithReadPrincipals(texts(_readAccessPrincipals), texts(_allAccessPrincipals),
-                                                  _baseLocation);
+        if (!_manager.setACLsWithReadPrincipals(texts(_readAccessPrincipals), texts(_allAccessPrincipals),
+                                                _baseLocation))
+            return false;
+        _unsaved.clear();
+        return true;
     } catch (const CXException& exception) {
         CXLog("Exception saving ACL: %@", exception);
         return false;

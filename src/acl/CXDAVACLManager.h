@@ -17,8 +17,9 @@ class CXDAVNode;
 // that somebody else published, the server is asked what the current user may do: the lists then hold "<self>" or
 // nobody. One thread at a time; operations wait for the server.
 //
-// What the owner grants or denies while the list could not be read is kept and carried out on what the next `save`
-// reads: a list that was never seen is not replaced.
+// What the owner grants or denies is kept until a `save` has carried it. While the list could not be read it is carried
+// out on what that `save` reads: a list that was never seen is not replaced.
+//   change = { "principal": string, "allAccess", "grant", "oneListOnly": boolean }
 class CXDAVACLManager final : public CXACLManager {
 public:
     // The namespace of the store's own elements.
@@ -30,6 +31,8 @@ public:
     bool load() override; // false: nothing could be read, and the lists are as they were
     // True without a request for somebody else's location; else whether the list is on the store.
     bool save() override;
+    Array unsaved() const override;
+    void resume(const Array& changes) override;
     // False: the owner's list could not be read yet. What cannot be read of somebody else's location is no access.
     bool isKnown() const override { return _loaded || !_publisher; }
 
@@ -64,7 +67,7 @@ private:
 
     CXDAVManager& _manager;
     bool _loaded = false;
-    std::vector<Change> _unseen; // what was asked for while the list on the store was not known
+    std::vector<Change> _unsaved; // the owner's, in order, each once: the last time that it was asked for
 };
 
 } // namespace rolvane

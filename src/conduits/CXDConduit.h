@@ -88,7 +88,7 @@ public:
     }
 
     std::string stringForDictionary(const Dictionary& dictionary) const; // XML property list
-    bool saveACLs();                                                     // true always
+    virtual bool saveACLs();                                             // true always
     virtual std::shared_ptr<CXACLManager> ACLManagerForRemoteLocation(const Url& location);
     std::optional<Url> baseLocationForRemoteLocation(const Url& location) const;
     std::optional<Url> locationForUID(const UniqueId& uid, const std::optional<UserName>& user) const;

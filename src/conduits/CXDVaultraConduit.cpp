@@ -388,6 +388,27 @@ bool CXDVaultraConduit::changeGroupReadWriteACL(CXDChangeRecord& record) {
     return true;
 }
 
+bool CXDVaultraConduit::saveACLs() {
+    const Dictionary unsaved = _world.preferences.get(kDaemonDomain, kUnsavedAccessListsKey).dictionary();
+    if (!_vaultraOffLine)
+        for (const auto& [location, changes] : unsaved) ACLManagerForRemoteLocation(Url(location));
+    const bool done = CXDConduit::saveACLs();
+    noteUnsavedAccessLists();
+    return done;
+}
+
+void CXDVaultraConduit::noteUnsavedAccessLists() {
+    const Dictionary before = _world.preferences.get(kDaemonDomain, kUnsavedAccessListsKey).dictionary();
+    Dictionary now = before.mutableCopy();
+    if (_ACLManagerMap)
+        for (const auto& [location, manager] : *_ACLManagerMap) {
+            const Array changes = manager->unsaved();
+            changes.empty() ? now.remove(location) : now.set(location, changes);
+        }
+    if (now == before) return;
+    _world.preferences.set(kDaemonDomain, kUnsavedAccessListsKey, now.empty() ? Value() : Value(now));
+}
+
 bool CXDVaultraConduit::keepsAccessLists() const {
     return _world.manager.keepsAccessLists().value_or(false);
 }
@@ -407,6 +428,9 @@ std::shared_ptr<CXACLManager> CXDVaultraConduit::ACLManagerForRemoteLocation(con
         manager = _world.makeACLManager(*base, engine());
     else
         manager = std::make_shared<CXDAVACLManager>(*base, engine(), _world.manager);
+    if (manager->publisher())
+        manager->resume(
+            _world.preferences.get(kDaemonDomain, kUnsavedAccessListsKey).dictionary()[base->absoluteString()].array());
     _ACLManagerMap->insert_or_assign(base->absoluteString(), manager);
     return manager;
 }

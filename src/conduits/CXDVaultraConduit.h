@@ -32,6 +32,9 @@ class CXDVaultraConduit : public CXDConduit {
 public:
     static constexpr const char* kLastSyncDateKey = "CXDVaultraConduitLastSyncDate";
     static constexpr const char* kLastWarningDateKey = "CXDLastUserPasswordWarningDate";
+    // What no save of the owner's access list has carried yet: base location to what the manager gives as unsaved.
+    // Written with the queue, so that another process goes on with it.
+    static constexpr const char* kUnsavedAccessListsKey = "CXDUnsavedAccessLists";
     static constexpr double kWarningInterval = 900;   // seconds between two password warnings
     static constexpr bool kSecureRecordWrites = true; // contact records, group states and new groups' "info"
 
@@ -71,6 +74,10 @@ public:
     // location has no base location.
     std::shared_ptr<CXACLManager> ACLManagerForRemoteLocation(const Url& location) override;
 
+    // As the base's; also the lists that an earlier process could not save. What is left is noted, without
+    // synchronising.
+    bool saveACLs() override;
+
     // As the base's, and what an older copy of the owner's tree has brought back on the store.
     CXDChangeRecords changeRecords() override;
     // As the base's, with every group file that has not changed since it was read last taken from the client's memory.
@@ -102,6 +109,7 @@ private:
     bool isMended(const Dictionary& prior, const Dictionary& state);
     bool isToBePublishedAgain();
     void forgetSubscribersRights();
+    void noteUnsavedAccessLists();
     int testReachability(); // sets _vaultraOffLine; the error's code, 0 when there was none
     std::optional<Url> baseLocationOf(const CXDChangeRecord& record) const;
 

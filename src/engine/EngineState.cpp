@@ -149,7 +149,7 @@ void EngineState::reset() {
     CXDLog("Reset!");
     for (const char* key :
          {kCXDPendingChanges, kCXDConduitData, kCXDVaultraConduitLastSyncDate, kCXDCXConduitLastSyncDate,
-          kCXDLocalConduitLastSyncDate, kCXDShareCount, kCXDLastOstrelUser})
+          kCXDLocalConduitLastSyncDate, kCXDShareCount, kCXDLastOstrelUser, kCXDUnsavedAccessLists})
         _preferences.remove(kDaemonDomain, key);
     _preferences.synchronize(kDaemonDomain);
     dropConduitData();

@@ -18,6 +18,7 @@ inline constexpr const char* kCXDConduitData = "CXDConduitData";
 inline constexpr const char* kCXDVaultraConduitLastSyncDate = "CXDVaultraConduitLastSyncDate";
 inline constexpr const char* kCXDCXConduitLastSyncDate = "CXDCXConduitLastSyncDate";
 inline constexpr const char* kCXDLocalConduitLastSyncDate = "CXDLocalConduitLastSyncDate";
+inline constexpr const char* kCXDUnsavedAccessLists = "CXDUnsavedAccessLists"; // see CXDVaultraConduit
 inline constexpr const char* kCXDShareCount = "CXDShareCount";
 inline constexpr const char* kCXDLastOstrelUser = "CXDLastOstrelUser";
 // What stores have refused, the latest last, for people to see: an array of dictionaries with these keys.

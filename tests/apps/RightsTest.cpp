@@ -1,4 +1,8 @@
 #include "Neighbour.h"
+#include "support/WaitUntil.h"
+
+#include <csignal>
+#include <filesystem>
 
 namespace rolvane::test {
 namespace {
@@ -112,6 +116,72 @@ TEST_F(Rights, GoWithThePublication) {
     world.done({"publish"});
     EXPECT_EQ(world.json({"shares"}), nlohmann::json::array());
     EXPECT_EQ(bob.json({"rights", "alice"})["read"], false);
+}
+
+// The store takes everything but lists: its directory of lists cannot be written.
+class RightsOnAFailingStore : public Rights {
+protected:
+    RightsOnAFailingStore() { world.done({"publish"}); }
+    ~RightsOnAFailingStore() override { fails(false); }
+    void fails(bool so) {
+        std::filesystem::permissions(world.store().stateDirectory() + "/lists",
+                                     so ? std::filesystem::perms::owner_read | std::filesystem::perms::owner_exec
+                                        : std::filesystem::perms::owner_all);
+    }
+    void killTheDaemon() {
+        const auto process = world.daemon();
+        ASSERT_TRUE(process);
+        ::kill(*process, SIGKILL);
+        ASSERT_TRUE(waitUntil([&] { return !world.daemon(); }, "the end of the daemon"));
+    }
+};
+
+TEST_F(RightsOnAFailingStore, AGrantThatCouldNotBeSavedIsSavedByTheNextProcess) {
+    fails(true);
+    EXPECT_EQ(world.rolvane({"share", "bob"}).status, kFailure);
+    killTheDaemon();
+    fails(false);
+    EXPECT_EQ(bob.json({"rights", "alice"})["read"], false);
+    world.done({"sync"});
+    EXPECT_EQ(world.json({"shares"}), nlohmann::json::array({share("bob", "read")}));
+    EXPECT_EQ(bob.json({"rights", "alice"})["read"], true);
+    world.done({"unshare", "bob"});
+    world.done({"daemon", "restart"});
+    world.done({"sync"});
+    EXPECT_EQ(world.json({"shares"}), nlohmann::json::array()) << "what was saved is not saved again";
+}
+
+TEST_F(RightsOnAFailingStore, AWithdrawalThatCouldNotBeSavedIsSavedByTheNextProcessAndNotTakenForAGrantOfTheStores) {
+    world.done({"share", "bob", "--write"});
+    world.done({"daemon", "stop"});
+    fails(true);
+    world.done({"unshare", "bob", "--no-daemon"});
+    world.done({"daemon", "start"});
+    world.done({"sync"});
+    EXPECT_EQ(bob.json({"rights", "alice"})["write"], true) << "the store does not know yet";
+    killTheDaemon();
+    fails(false);
+    world.done({"sync"});
+    EXPECT_EQ(world.json({"shares"}), nlohmann::json::array());
+    EXPECT_EQ(bob.json({"rights", "alice"})["read"], false);
+}
+
+TEST_F(RightsOnAFailingStore, AGrantThatWasNeverSavedIsForgottenWithThePublication) {
+    fails(true);
+    EXPECT_EQ(world.rolvane({"share", "bob"}).status, kFailure);
+    fails(false);
+    world.done({"unpublish"});
+    world.done({"publish"});
+    EXPECT_EQ(world.json({"shares"}), nlohmann::json::array());
+}
+
+TEST_F(RightsOnAFailingStore, WhatTheStoreDoesNotTakeBackIsNotTakenBackHereEither) {
+    world.done({"share", "bob"});
+    fails(true);
+    const Ran ran = world.rolvane({"unshare", "bob"});
+    EXPECT_EQ(ran.status, kFailure) << ran;
+    EXPECT_NE(ran.errors.find("Nothing was changed here"), std::string::npos) << ran;
+    EXPECT_EQ(world.json({"shares"}), nlohmann::json::array({share("bob", "read")}));
 }
 
 TEST(RightsOnAPlainStore, AreWhatItsAdministratorSaysAndShareTellsSo) {
