@@ -101,6 +101,7 @@ void ApplyLoop::run(CXDChangeRecords records, bool trickle, bool allowRetry) {
         CXLog("applyChangeRecords close: Caught %@: %@", e.name(), e.reason());
         if (trickle && !_queueStored) notStored = std::current_exception();
     }
+    _parts.denied.clear(); // also when nothing could be stored: what comes again is to be asked again
     _parts.revoked.clear();
     bumpShareCount();
     _parts.with.progress.stop();

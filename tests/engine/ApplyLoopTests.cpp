@@ -280,6 +280,23 @@ TEST_F(Pass, AFullDiskLeavesTheChangesWithWhoeverDeliveredThem) {
     EXPECT_EQ(world.pending(), Strings{"P1:2"});
 }
 
+TEST_F(Pass, ARefusalInAPassThatCouldNotBeStoredDoesNotReachIntoTheNext) {
+    trickle({});
+    world.vaultra->whenApplying = [](const CXDChangeRecordPtr&, bool* denied) {
+        test::interceptWrites([] { return false; });
+        *denied = true;
+        return false;
+    };
+    test::CapturingLog log;
+    EXPECT_THROW(trickle({update("P1", 4, "bob"), update("P2", CXDSyncSourceLocal)}), CXException);
+    test::interceptWrites(nullptr);
+
+    world.vaultra->whenApplying = nullptr; // granted meanwhile
+    trickle({update("P1", 4, "bob"), update("P2", CXDSyncSourceLocal)});
+    EXPECT_EQ(world.vaultra->applied(), (Strings{"P1", "P1"})) << "delivered again, it was taken for refused";
+    EXPECT_EQ(world.pending(), Strings{"P2:2"});
+}
+
 TEST_F(Pass, WhatTheContactDatabaseCouldNotSaveIsNotWrittenDownAsApplied) {
     trickle({});
     const auto known = [&] {
