@@ -68,7 +68,9 @@ bool readAll(int fd, std::string& out) {
     while (out.size() < kMaxBytes) {
         const auto left = duration_cast<milliseconds>(deadline - steady_clock::now()).count();
         pollfd p{fd, POLLIN, 0};
-        if (left <= 0 || poll(&p, 1, static_cast<int>(left)) <= 0) return false;
+        const int ready = left <= 0 ? 0 : poll(&p, 1, static_cast<int>(left));
+        if (ready < 0 && errno == EINTR) continue;
+        if (ready <= 0) return false;
         char buffer[512];
         const ssize_t n = read(fd, buffer, sizeof buffer);
         if (n <= 0) return true;
@@ -100,7 +102,15 @@ std::string fromCommand(const std::string& command) {
     posix_spawn_file_actions_addopen(&actions, 0, "/dev/null", O_RDONLY, 0);
     const char* arguments[] = {"/bin/sh", "-c", command.c_str(), nullptr};
     pid_t child = 0;
-    const int error = posix_spawn(&child, "/bin/sh", &actions, nullptr, const_cast<char**>(arguments), environ);
+    // The daemon's threads block signals, and what is blocked is inherited, by whatever the command starts, too.
+    posix_spawnattr_t attributes;
+    posix_spawnattr_init(&attributes);
+    sigset_t none;
+    sigemptyset(&none);
+    posix_spawnattr_setsigmask(&attributes, &none);
+    posix_spawnattr_setflags(&attributes, POSIX_SPAWN_SETSIGMASK);
+    const int error = posix_spawn(&child, "/bin/sh", &actions, &attributes, const_cast<char**>(arguments), environ);
+    posix_spawnattr_destroy(&attributes);
     posix_spawn_file_actions_destroy(&actions);
     close(ends[1]);
     if (error != 0) fail(std::string("The password command cannot be started: ") + strerror(error) + ".");

@@ -5,6 +5,7 @@
 #include "store/VersionMemory.h"
 #include "support/TempHome.h"
 
+#include <csignal>
 #include <filesystem>
 #include <fstream>
 #include <gmock/gmock.h>
@@ -165,6 +166,17 @@ TEST(Account, LoopbackIsToldByAddress) {
     for (const char* h : {"localhost", "127.0.0.1", "127.9.9.9", "::1"}) EXPECT_TRUE(isLoopbackHost(h)) << h;
     for (const char* h : {"localhost.example.org", "10.0.0.1", "1270.0.0.1", "", "::2"})
         EXPECT_FALSE(isLoopbackHost(h)) << h;
+}
+
+// What it starts in turn (an agent that stays, say) would be deaf to them for life.
+TEST(Account, APasswordCommandHearsTheSignalsThatThisThreadDoesNot) {
+    sigset_t all, before;
+    sigfillset(&all);
+    pthread_sigmask(SIG_SETMASK, &all, &before);
+    const std::string blocked = reasonOf({PasswordSource::Kind::command, "grep SigBlk /proc/self/status"});
+    pthread_sigmask(SIG_SETMASK, &before, nullptr);
+    EXPECT_THAT(blocked, testing::StartsWith("password: SigBlk:"));
+    EXPECT_THAT(blocked, HasSubstr("\t0000000000000000"));
 }
 
 TEST(NetworkController, LoopbackIsAlwaysReachableAndNoHostNever) {
