@@ -212,6 +212,7 @@ bool DaemonControl::start() const {
         if (fds[0].revents && notify.ready()) return true;
         if (fds[1].revents) {
             ::waitpid(pid, nullptr, 0);
+            if (running()) return false; // somebody who started it at the same moment was faster
             fail(fmt::format("RolvaneManager ended at once. Its last words: {}", logTail(logPath(), 4096)));
         }
     }
