@@ -181,7 +181,8 @@ def subscription(world, owner, endpoint, authority):
             check("does not let you read" in said, f"{person.name} gets nothing: exit code {code}")
     with Step("The owner shares for reading"):
         talk(owner, "share", subscriber.name)
-        check(owner.json("shares") == [{"user": "cleo", "rights": "read", "store": "read", "agrees": True}],
+        check([{**share, "readsSince": bool(share["readsSince"])} for share in owner.json("shares")] ==
+              [{"user": "cleo", "rights": "read", "readsSince": True, "writesSince": None, "store": "read", "agrees": True}],
               "the store has it")
     with Step("Subscribe to the contacts of another user"):
         began = time.monotonic()

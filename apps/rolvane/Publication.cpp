@@ -4,6 +4,7 @@
 
 #include "contacts/Constants.h"
 #include "contacts/Identifier.h"
+#include "contacts/SharingDates.h"
 #include "engine/EngineState.h"
 #include "engine/PublicationCache.h"
 #include "model/RemoteLocationMap.h"
@@ -79,7 +80,8 @@ bool Publication::publishGroup(const CXGroupRef& group, const Url& base) {
 bool Publication::withdrawEverything() {
     if (!everything()) return false;
     const CXAllGroupRef all = _database.allGroup();
-    for (const char* property : {kCXRemoteLocationProperty, kCXReadSharingACLProperty, kCXReadWriteSharingACLProperty})
+    for (const char* property : {kCXRemoteLocationProperty, kCXReadSharingACLProperty, kCXReadWriteSharingACLProperty,
+                                 kCXReadSharingDatesProperty, kCXReadWriteSharingDatesProperty})
         all->removeValueForProperty(property);
     settle();
     return true;

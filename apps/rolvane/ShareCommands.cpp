@@ -56,6 +56,10 @@ Json orNull(const char* text) {
     return text ? Json(text) : Json();
 }
 
+Json orNull(const std::optional<Date>& date) {
+    return date ? Json(date->toISO8601()) : Json();
+}
+
 // Refuses where the store cannot do what is asked.
 void requireAccessLists(const Url& base, const std::string& user) {
     CXDAVError error;
@@ -202,6 +206,8 @@ void listShares(Context& context) {
         const char *here = rightsHere(shares, user), *there = lists ? lists->rightsOf(user) : nullptr;
         all.push_back({{"user", user},
                        {"rights", orNull(here)},
+                       {"readsSince", orNull(shares.readsSince(user))},
+                       {"writesSince", orNull(shares.writesSince(user))},
                        {"store", orNull(there)},
                        {"agrees", lists ? Json(same(here, there)) : Json()}});
     }
@@ -210,8 +216,16 @@ void listShares(Context& context) {
     const auto words = [](const Json& rights) {
         return rights.is_null() ? "nothing" : rights == "write" ? "read and write" : "read";
     };
+    const auto since = [](const Json& share) {
+        const auto date = [&](const char* key) {
+            return share[key].is_null() ? std::string("-") : share[key].get<std::string>();
+        };
+        if (share["rights"].is_null()) return std::string();
+        const std::string writes = share["rights"] == "write" ? ", writes since " + date("writesSince") : "";
+        return "  reads since " + date("readsSince") + writes;
+    };
     for (const Json& share : all)
-        context.line(fmt::format("{}  {}{}", share["user"].get<std::string>(), words(share["rights"]),
+        context.line(fmt::format("{}  {}{}{}", share["user"].get<std::string>(), words(share["rights"]), since(share),
                                  share["agrees"].is_null() ? "  (the store does not tell)"
                                  : share["agrees"]         ? ""
                                                            : fmt::format("  (the store: {})", words(share["store"]))));
@@ -282,8 +296,8 @@ void addShareCommands(CLI::App& app, Context& context) {
         [&context, o] { changeShares(context, *o, true); });
     addCommand(app, context, "unshare", "Take a user's rights back", common,
                [&context, o] { changeShares(context, *o, false); });
-    addCommand(app, context, "shares", "List who may read and who may write, and whether the store agrees", nullptr,
-               [&context] { listShares(context); });
+    addCommand(app, context, "shares", "List who may read and who may write, since when, and whether the store agrees",
+               nullptr, [&context] { listShares(context); });
     const auto named = std::make_shared<std::string>();
     addCommand(
         app, context, "rights", "Tell what you may do with another user's contacts",

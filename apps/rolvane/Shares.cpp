@@ -3,6 +3,8 @@
 #include "Publication.h"
 
 #include "contacts/Constants.h"
+#include "contacts/SharingDates.h"
+#include "foundation/Date.h"
 
 #include <algorithm>
 
@@ -14,6 +16,16 @@ constexpr const char* kLists[] = {kCXReadSharingACLProperty, kCXReadWriteSharing
 
 bool contains(const std::vector<std::string>& list, const std::string& name) {
     return std::find(list.begin(), list.end(), name) != list.end();
+}
+
+const char* datesOf(std::string_view list) {
+    return list == kCXReadSharingACLProperty ? kCXReadSharingDatesProperty : kCXReadWriteSharingDatesProperty;
+}
+
+// An empty list is none.
+bool store(CXAllGroup& group, const CXMultiValue& list, const char* property) {
+    if (!list.empty()) return group.setValue(list, property);
+    return group.valueForProperty(property) && group.removeValueForProperty(property);
 }
 
 } // namespace
@@ -55,8 +67,32 @@ bool Shares::put(const char* property, const std::string& user, bool wanted) {
         for (size_t i = list.count(); i-- > 0;)
             if (list.valueAtIndex(i).string() == user) list.removeAtIndex(i);
     }
-    if (list.empty()) return _database.allGroup()->removeValueForProperty(property);
-    return _database.allGroup()->setValue(list, property);
+    putDate(datesOf(property), user, wanted);
+    return store(*_database.allGroup(), list, property);
+}
+
+void Shares::putDate(const char* property, const std::string& user, bool wanted) {
+    CXMutableMultiValue dates;
+    if (const auto held = _database.allGroup()->multiValueForProperty(property)) dates = CXMutableMultiValue(*held);
+    for (size_t i = dates.count(); i-- > 0;)
+        if (dates.labelAtIndex(i) == user) dates.removeAtIndex(i);
+    if (wanted) dates.addValue(Clock::system().now(), user);
+    store(*_database.allGroup(), dates, property);
+}
+
+std::optional<Date> Shares::since(const char* property, const std::string& user) const {
+    if (const auto dates = _database.allGroup()->multiValueForProperty(property))
+        for (const CXMultiValue::Entry& entry : dates->entries())
+            if (entry.label == user) return entry.value.date();
+    return std::nullopt;
+}
+
+std::optional<Date> Shares::readsSince(const std::string& user) const {
+    return mayRead(user) ? since(kCXReadSharingDatesProperty, user) : std::nullopt;
+}
+
+std::optional<Date> Shares::writesSince(const std::string& user) const {
+    return mayWrite(user) ? since(kCXReadWriteSharingDatesProperty, user) : std::nullopt;
 }
 
 bool Shares::grant(const std::string& user, bool write) {

@@ -46,7 +46,7 @@ complete -c rolvane -n '__rolvane_at' -a publish -d 'Publish the contact list, o
 complete -c rolvane -n '__rolvane_at' -a unpublish -d 'Withdraw a publication and take its files off the store'
 complete -c rolvane -n '__rolvane_at' -a share -d 'Let another user of the store read what you publish, or change it, too'
 complete -c rolvane -n '__rolvane_at' -a unshare -d 'Take a user\'s rights back'
-complete -c rolvane -n '__rolvane_at' -a shares -d 'List who may read and who may write, and whether the store agrees'
+complete -c rolvane -n '__rolvane_at' -a shares -d 'List who may read and who may write, since when, and whether the store agrees'
 complete -c rolvane -n '__rolvane_at' -a rights -d 'Tell what you may do with another user\'s contacts'
 complete -c rolvane -n '__rolvane_at' -a subscribe -d 'Take what another user has published, and keep it in step'
 complete -c rolvane -n '__rolvane_at' -a unsubscribe -d 'End a subscription; what came by it leaves this database'

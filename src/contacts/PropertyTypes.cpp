@@ -2,6 +2,7 @@
 
 #include "contacts/CXRecord.h"
 #include "contacts/RecordKind.h"
+#include "contacts/SharingDates.h"
 #include "foundation/Utf8.h"
 
 #include <algorithm>
@@ -24,7 +25,9 @@ constexpr std::array kAnyRecord{KnownProperty{kCXRemoteLocationProperty, Type::m
                                 KnownProperty{kCXNoteProperty, Type::string},
                                 KnownProperty{kCXVCardExtraProperty, Type::array}};
 
-constexpr std::array kGroupOnly{KnownProperty{kCXGroupNameProperty, Type::string}};
+constexpr std::array kGroupOnly{KnownProperty{kCXGroupNameProperty, Type::string},
+                                KnownProperty{kCXReadSharingDatesProperty, Type::multiDate},
+                                KnownProperty{kCXReadWriteSharingDatesProperty, Type::multiDate}};
 
 constexpr std::array kSubscriptionOnly{KnownProperty{kCXRemoteLocationProperty, Type::string},
                                        KnownProperty{kCXSubscriptionIsAllProperty, Type::boolean},

@@ -1,4 +1,7 @@
 #include "Neighbour.h"
+#include "contacts/CXRolvane.h"
+#include "contacts/SharingDates.h"
+#include "foundation/Date.h"
 #include "support/WaitUntil.h"
 
 #include <csignal>
@@ -19,6 +22,15 @@ protected:
     static nlohmann::json share(const char* user, const char* rights) {
         return {{"user", user}, {"rights", rights}, {"store", rights}, {"agrees", true}};
     }
+    // What `shares` prints, but for the dates.
+    nlohmann::json shares() {
+        nlohmann::json all = world.json({"shares"});
+        for (auto& each : all) {
+            each.erase("readsSince");
+            each.erase("writesSince");
+        }
+        return all;
+    }
     CommandWorld world;
     Neighbour bob{world, "bob"};
 };
@@ -27,19 +39,64 @@ TEST_F(Rights, AreGrantedLoweredAndTakenBackAndTheStoreHasThemWhenTheCommandRetu
     world.done({"publish"});
     EXPECT_EQ(world.json({"shares"}), nlohmann::json::array());
     EXPECT_EQ(world.json({"share", "bob"}), (nlohmann::json{{"user", "bob"}, {"rights", "read"}}));
-    EXPECT_EQ(world.json({"shares"}), nlohmann::json::array({share("bob", "read")}));
+    EXPECT_EQ(shares(), nlohmann::json::array({share("bob", "read")}));
     EXPECT_EQ(bob.json({"rights", "alice"})["read"], true);
     EXPECT_EQ(bob.json({"rights", "alice"})["write"], false);
     world.done({"share", "bob", "--write"});
-    EXPECT_EQ(world.json({"shares"}), nlohmann::json::array({share("bob", "write")}));
+    EXPECT_EQ(shares(), nlohmann::json::array({share("bob", "write")}));
     EXPECT_EQ(bob.json({"rights", "alice"})["write"], true);
     world.done({"share", "bob"});
-    EXPECT_EQ(world.json({"shares"}), nlohmann::json::array({share("bob", "read")}));
+    EXPECT_EQ(shares(), nlohmann::json::array({share("bob", "read")}));
     EXPECT_EQ(bob.json({"rights", "alice"})["write"], false);
     world.done({"unshare", "bob"});
     EXPECT_EQ(world.json({"shares"}), nlohmann::json::array());
     EXPECT_EQ(bob.json({"rights", "alice"})["read"], false);
     EXPECT_EQ(bob.done({"rights", "bob"}), "bob  read and write\n");
+}
+
+TEST_F(Rights, AreListedWithTheMomentsSinceWhichTheyHold) {
+    const auto listed = [&] { return world.json({"shares"})[0]; };
+    const auto begins = [](const nlohmann::json& date) { return Date::fromISO8601(date.get<std::string>()).value(); };
+    const Date before = Clock::system().now();
+    world.done({"publish"});
+    world.done({"share", "bob"});
+    const auto reads = listed()["readsSince"];
+    EXPECT_GE(begins(reads).secondsSince(before), -1);
+    EXPECT_GE(Clock::system().now().secondsSince(begins(reads)), 0);
+    EXPECT_TRUE(listed()["writesSince"].is_null());
+    EXPECT_EQ(world.done({"shares"}), "bob  read  reads since " + reads.get<std::string>() + "\n");
+    world.done({"share", "bob", "--write"});
+    const auto writes = listed()["writesSince"];
+    EXPECT_GE(begins(writes).secondsSince(begins(reads)), 0);
+    EXPECT_EQ(listed()["readsSince"], reads) << "a raised right has been read with for longer";
+    EXPECT_EQ(world.done({"shares"}), "bob  read and write  reads since " + reads.get<std::string>() +
+                                          ", writes since " + writes.get<std::string>() + "\n");
+    world.done({"share", "bob", "--write"});
+    EXPECT_EQ(listed()["writesSince"], writes) << "what is granted already keeps its date";
+    world.done({"share", "bob"});
+    EXPECT_TRUE(listed()["writesSince"].is_null());
+    EXPECT_EQ(listed()["readsSince"], reads);
+}
+
+// What a version that noted no date has left.
+TEST_F(Rights, WithoutADateShowADash) {
+    world.done({"publish"});
+    world.done({"share", "bob", "--write"});
+    world.done({"daemon", "stop"});
+    {
+        CXRolvane::Options options;
+        options.path = world.home / "data/rolvane/contacts.db";
+        CXRolvane database(options);
+        database.allGroup()->removeValueForProperty(kCXReadSharingDatesProperty);
+        database.allGroup()->removeValueForProperty(kCXReadWriteSharingDatesProperty);
+        database.save();
+    }
+    EXPECT_EQ(world.done({"shares"}), "bob  read and write  reads since -, writes since -\n");
+    EXPECT_TRUE(world.json({"shares"})[0]["readsSince"].is_null());
+    world.done({"share", "bob"});
+    world.done({"share", "bob", "--write"});
+    EXPECT_TRUE(world.json({"shares"})[0]["readsSince"].is_null());
+    EXPECT_TRUE(world.json({"shares"})[0]["writesSince"].is_string());
 }
 
 TEST_F(Rights, TheDaemonStartsAnewForTheFirstWriterAndTheLastOnly) {
@@ -63,7 +120,7 @@ TEST_F(Rights, TheDaemonStartsAnewForTheFirstWriterAndTheLastOnly) {
 TEST_F(Rights, APublishedGroupIsSharedToo) {
     world.done({"publish", "--group", "Family"});
     world.done({"share", "bob"});
-    EXPECT_EQ(world.json({"shares"}), nlohmann::json::array({share("bob", "read")}));
+    EXPECT_EQ(shares(), nlohmann::json::array({share("bob", "read")}));
     bob.done({"subscribe", "alice"});
     const auto people = bob.json({"list", "--of", "alice"});
     ASSERT_EQ(people.size(), 1U);
@@ -143,7 +200,7 @@ TEST_F(RightsOnAFailingStore, AGrantThatCouldNotBeSavedIsSavedByTheNextProcess) 
     fails(false);
     EXPECT_EQ(bob.json({"rights", "alice"})["read"], false);
     world.done({"sync"});
-    EXPECT_EQ(world.json({"shares"}), nlohmann::json::array({share("bob", "read")}));
+    EXPECT_EQ(shares(), nlohmann::json::array({share("bob", "read")}));
     EXPECT_EQ(bob.json({"rights", "alice"})["read"], true);
     world.done({"unshare", "bob"});
     world.done({"daemon", "restart"});
@@ -181,7 +238,7 @@ TEST_F(RightsOnAFailingStore, WhatTheStoreDoesNotTakeBackIsNotTakenBackHereEithe
     const Ran ran = world.rolvane({"unshare", "bob"});
     EXPECT_EQ(ran.status, kFailure) << ran;
     EXPECT_NE(ran.errors.find("Nothing was changed here"), std::string::npos) << ran;
-    EXPECT_EQ(world.json({"shares"}), nlohmann::json::array({share("bob", "read")}));
+    EXPECT_EQ(shares(), nlohmann::json::array({share("bob", "read")}));
 }
 
 TEST(RightsOnAPlainStore, AreWhatItsAdministratorSaysAndShareTellsSo) {
