@@ -4,9 +4,11 @@
 #include "foundation/Paths.h"
 
 #include <cerrno>
+#include <chrono>
 #include <cstring>
 #include <fcntl.h>
 #include <fmt/format.h>
+#include <thread>
 #include <unistd.h>
 #include <utility>
 
@@ -14,13 +16,38 @@ namespace rolvane {
 
 namespace {
 
-// The lock is of the open file description, so that it dies with the process and is not lost when another part of the
-// process opens and closes the file; F_OFD_GETLK cannot tell the holder's number, so the file's text does.
-bool tryLock(int fd, short type) {
+// The locks are of the open file description, so that they die with the process and are not lost when another part of
+// the process opens and closes the file; F_OFD_GETLK cannot tell the holder's number, so the file's text does. The
+// first byte's lock says that there is a holder, the second's that the number in the file is the holder's.
+constexpr off_t kHeld = 0, kNamed = 1;
+
+struct flock writeLockOf(off_t byte) {
     struct flock lock = {};
-    lock.l_type = type;
+    lock.l_type = F_WRLCK;
     lock.l_whence = SEEK_SET;
+    lock.l_start = byte;
+    lock.l_len = 1;
+    return lock;
+}
+
+bool tryLock(int fd, off_t byte) {
+    struct flock lock = writeLockOf(byte);
     return ::fcntl(fd, F_OFD_SETLK, &lock) == 0;
+}
+
+bool isLockedByAnother(int fd, off_t byte) {
+    struct flock lock = writeLockOf(byte);
+    return ::fcntl(fd, F_OFD_GETLK, &lock) == 0 && lock.l_type != F_UNLCK;
+}
+
+// Until the holder, which has just come, has put down its number; false when there is none, or none that does.
+bool isHeldAndNamed(int fd) {
+    constexpr int kTries = 1000;
+    for (int i = 0; i < kTries && isLockedByAnother(fd, kHeld); ++i) {
+        if (isLockedByAnother(fd, kNamed)) return true;
+        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    }
+    return false;
 }
 
 } // namespace
@@ -36,9 +63,10 @@ std::optional<InstanceLock> InstanceLock::acquire(const std::string& path) {
                           fmt::format("The lock file {} cannot be opened ({}). Check the directory's owner and rights.",
                                       path, std::strerror(errno)));
     InstanceLock lock(fd);
-    if (!tryLock(fd, F_WRLCK)) return std::nullopt;
+    if (!tryLock(fd, kHeld)) return std::nullopt;
     const std::string text = fmt::format("{}\n", ::getpid());
-    if (::ftruncate(fd, 0) != 0 || ::pwrite(fd, text.data(), text.size(), 0) != static_cast<ssize_t>(text.size()))
+    if (::ftruncate(fd, 0) != 0 || ::pwrite(fd, text.data(), text.size(), 0) != static_cast<ssize_t>(text.size()) ||
+        !tryLock(fd, kNamed))
         throw CXException("CXDaemonException", fmt::format("The lock file {} cannot be written ({}). Is the disk full?",
                                                            path, std::strerror(errno)));
     return lock;
@@ -48,10 +76,7 @@ std::optional<pid_t> InstanceLock::holder(const std::string& path) {
     const int fd = ::open(path.c_str(), O_RDWR | O_CLOEXEC);
     if (fd < 0) return std::nullopt;
     InstanceLock probe(fd);
-    struct flock lock = {};
-    lock.l_type = F_WRLCK;
-    lock.l_whence = SEEK_SET;
-    if (::fcntl(fd, F_OFD_GETLK, &lock) != 0 || lock.l_type == F_UNLCK) return std::nullopt;
+    if (!isHeldAndNamed(fd)) return std::nullopt;
     char text[32] = {};
     const ssize_t n = ::pread(fd, text, sizeof text - 1, 0);
     const long pid = n > 0 ? std::strtol(text, nullptr, 10) : 0;

@@ -4,7 +4,9 @@
 #include "support/ChildProcess.h"
 #include "support/TempHome.h"
 
+#include <fcntl.h>
 #include <fstream>
+#include <future>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -49,6 +51,28 @@ TEST_F(InstanceLockOf, AFileThatAnEarlierProcessLeftBehindIsNoObstacle) {
     const auto lock = InstanceLock::acquire(path);
     ASSERT_TRUE(lock);
     EXPECT_EQ(InstanceLock::holder(path), ::getpid());
+}
+
+// Between the two of them the number is still that of an earlier process.
+TEST_F(InstanceLockOf, AHolderThatHasNotPutDownItsNumberYetIsWaitedFor) {
+    std::ofstream(path) << "1\n";
+    const int fd = ::open(path.c_str(), O_RDWR | O_CLOEXEC);
+    const auto lockByte = [&](off_t byte) {
+        struct flock lock = {};
+        lock.l_type = F_WRLCK;
+        lock.l_whence = SEEK_SET;
+        lock.l_start = byte;
+        lock.l_len = 1;
+        return ::fcntl(fd, F_OFD_SETLK, &lock) == 0;
+    };
+    ASSERT_TRUE(lockByte(0));
+    EXPECT_FALSE(InstanceLock::acquire(path));
+    auto asked = std::async(std::launch::async, [&] { return InstanceLock::holder(path); });
+    EXPECT_EQ(asked.wait_for(std::chrono::milliseconds(20)), std::future_status::timeout);
+    std::ofstream(path) << "4711\n";
+    ASSERT_TRUE(lockByte(1));
+    EXPECT_EQ(asked.get(), 4711);
+    ::close(fd);
 }
 
 TEST_F(InstanceLockOf, MovingKeepsIt) {
