@@ -58,7 +58,8 @@ void ChangeWatcher::readEvents() {
             std::memcpy(&event, buffer + at, sizeof event);
             std::string name = event.len ? std::string(buffer + at + sizeof event) : std::string();
             at += static_cast<ssize_t>(sizeof event + event.len);
-            if (name == _name + kTouchSuffix || (event.mask & IN_Q_OVERFLOW)) callSoon();
+            const bool replaced = name == _name && (event.mask & (IN_CREATE | IN_MOVED_TO));
+            if (name == _name + kTouchSuffix || replaced || (event.mask & IN_Q_OVERFLOW)) callSoon();
             if (name == _name + kLogSuffix) callLater();
         }
     }

@@ -36,6 +36,9 @@ struct CXRolvane::Impl {
     std::optional<Scanned> scanned;
     std::unique_ptr<ChangeWatcher> watcher;
 
+    // CXException when the path names another file by now: what is read is of the past, what is saved would be lost.
+    void requireSameFile() const;
+
     // Handles
     CXRecordRef handle(const UniqueId& uid); // null when there is no such record
     template <class T>

@@ -166,8 +166,16 @@ private:
 
 } // namespace
 
+void CXRolvane::Impl::requireSameFile() const {
+    if (sqlite.hasMoved())
+        throw CXException(kCXDatabaseException, "The contact database " + options.path +
+                                                    " was moved away or replaced while this program had it open. "
+                                                    "Start this program again.");
+}
+
 void CXRolvane::Impl::save() {
     if (work.empty()) return;
+    requireSameFile();
     bool changedRecords;
     {
         SqliteTransaction transaction(sqlite);

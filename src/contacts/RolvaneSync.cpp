@@ -51,6 +51,7 @@ int64_t CXRolvane::Impl::cursor() {
 bool CXRolvane::deliverExternalChanges() {
     std::unique_lock lock(_impl->mutex);
     if (_impl->delivering) return false;
+    _impl->requireSameFile();
     int64_t from = _impl->cursor();
     int64_t end = _impl->journal.position();
     if (end <= from) return false;

@@ -68,6 +68,8 @@ Sqlite::Sqlite(const std::string& path, int busyTimeoutMilliseconds) : _path(pat
 
 Sqlite::~Sqlite() {
     _prepared.clear();
+    // The log's path may already belong to a successor of this file; it must not be taken away from it.
+    if (hasMoved()) sqlite3_db_config(_handle, SQLITE_DBCONFIG_NO_CKPT_ON_CLOSE, 1, nullptr);
     sqlite3_close_v2(_handle);
 }
 
@@ -94,6 +96,11 @@ void Sqlite::execute(const std::string& sql) {
 int64_t Sqlite::integer(std::string_view sql) {
     Statement s = statement(sql);
     return s.step() ? s.integer(0) : 0;
+}
+
+bool Sqlite::hasMoved() const {
+    int moved = 0;
+    return sqlite3_file_control(_handle, "main", SQLITE_FCNTL_HAS_MOVED, &moved) == SQLITE_OK && moved != 0;
 }
 
 int Sqlite::changes() const {

@@ -57,6 +57,8 @@ public:
         std::shared_ptr<Prepared> _prepared;
     };
 
+    bool hasMoved() const; // its path names another file by now, or none
+
     Statement statement(std::string_view sql); // kept prepared; a second loan of one text prepares another
     void execute(const std::string& sql);      // any number of statements, no results
     int64_t integer(std::string_view sql);     // first column of the first row, 0 when there is none

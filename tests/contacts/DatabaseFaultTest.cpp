@@ -157,6 +157,24 @@ TEST(DatabaseFault, AReadOnlyDatabaseCanBeReadAndSaysWhyItCannotBeWritten) {
     for (const char* suffix : {"", "-wal", "-shm"}) ::chmod((d.path + suffix).c_str(), 0600);
 }
 
+TEST(DatabaseFault, AFileThatWasReplacedIsWrittenNoMoreAndItsSuccessorIsLeftAlone) {
+    TestDatabase d;
+    d.addPerson("Ada");
+    d->save();
+    for (const char* part : {"", "-wal", "-shm"}) std::filesystem::rename(d.path + part, d.path + ".former" + part);
+    const auto successor = d.open("rolvane");
+    TestDatabase::addPersonTo(*successor, "Grace", "G:CXPerson");
+    successor->save();
+
+    d.addPerson("Eve");
+    for (const std::string& told : {reasonOf([&] { d->save(); }), reasonOf([&] { d->deliverExternalChanges(); })}) {
+        EXPECT_TELLS(told, "replaced");
+        EXPECT_TELLS(told, d.path);
+    }
+    d.database.reset();
+    EXPECT_TRUE(d.open("third")->recordForUniqueId(UniqueId("G:CXPerson"))) << "its log was taken away";
+}
+
 TEST(DatabaseFault, ADirectoryInThePlaceOfTheFileIsToldClearly) {
     TestDatabase d;
     std::filesystem::create_directory(d.directory / "here.db");

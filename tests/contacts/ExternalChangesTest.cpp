@@ -1,8 +1,10 @@
 #include "TestDatabase.h"
 
+#include "contacts/Sqlite.h"
 #include "support/PrivateBus.h"
 #include "support/WaitUntil.h"
 
+#include <filesystem>
 #include <map>
 #include <set>
 
@@ -347,6 +349,25 @@ TEST(ExternalChanges, AFileWatchWakesARunLoopWithoutAnyBus) {
     EXPECT_TRUE(waitUntil([&] { return !d.heard.empty(); }, "the other process's save"));
     ASSERT_EQ(d.heard.size(), 1u);
     EXPECT_EQ(d.list(d.heard[0], kCXInsertedRecords), (Strings{"A:CXPerson"}));
+}
+
+// A backup, say. Whoever goes on with the former file lives in the past.
+TEST(ExternalChanges, AnotherFileInTheDatabasesPlaceIsNoticedAtOnce) {
+    Watching d;
+    const std::string other = d.directory / "other.db";
+    Sqlite(other, 0).execute("CREATE TABLE t(x)");
+    auto options = d.options();
+    options.runLoop = &RunLoop::current();
+    d.database = std::make_unique<CXRolvane>(options);
+    for (int i = 0; i < 3; ++i) RunLoop::current().runOnce(0);
+    std::filesystem::rename(other, d.path);
+    std::string told;
+    try {
+        waitUntil([] { return false; }, "word of the replacement", 10);
+    } catch (const CXException& e) {
+        told = e.reason();
+    }
+    EXPECT_NE(told.find("replaced"), std::string::npos) << told;
 }
 
 TEST(ExternalChanges, WhatWaitedWhileNobodyWatchedIsDeliveredInTheFirstTurns) {
