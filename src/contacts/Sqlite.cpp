@@ -68,8 +68,7 @@ Sqlite::Sqlite(const std::string& path, int busyTimeoutMilliseconds) : _path(pat
 
 Sqlite::~Sqlite() {
     _prepared.clear();
-    // The log's path may already belong to a successor of this file; it must not be taken away from it.
-    if (hasMoved()) sqlite3_db_config(_handle, SQLITE_DBCONFIG_NO_CKPT_ON_CLOSE, 1, nullptr);
+    // Of a file that has moved SQLite leaves the log alone: its path may belong to a successor by now.
     sqlite3_close_v2(_handle);
 }
 
