@@ -7,6 +7,7 @@
 
 #include <algorithm>
 #include <cstdio>
+#include <ctime>
 #include <unistd.h>
 
 namespace rolvane {
@@ -109,14 +110,21 @@ bool settled(const HttpResponse& answer) {
     return answer.complete() && answer.status != 401 && answer.status < 500;
 }
 
+double secondsSinceBoot() {
+    timespec now{};
+    ::clock_gettime(CLOCK_BOOTTIME, &now);
+    return static_cast<double>(now.tv_sec) + static_cast<double>(now.tv_nsec) / 1e9;
+}
+
 bool isPlausible(const LockToken& token) {
     return !token.empty() && token.str().size() < 1024 && token.str().find_first_of("<>\r\n ") == std::string::npos;
 }
 
 } // namespace
 
-StoreLock::StoreLock(std::shared_ptr<CXDAVManager::Impl> client, Url name, LockLedger ledger)
-    : _client(client), _name(std::move(name)), _endpoint(client->session.endpoint(_name)), _ledger(std::move(ledger)) {}
+StoreLock::StoreLock(std::shared_ptr<CXDAVManager::Impl> client, Url name, LockLedger ledger, const Clock& clock)
+    : _client(client), _name(std::move(name)), _endpoint(client->session.endpoint(_name)), _ledger(std::move(ledger)),
+      _clock(clock) {}
 
 // A LOCK request: a new lock, or the refresh of the token's.
 HttpResponse StoreLock::ask(const LockToken& refreshed) {
@@ -149,7 +157,7 @@ bool StoreLock::take(const HttpResponse& answer, const LockToken& known) {
     {
         std::lock_guard guard(_mutex);
         _token = token;
-        _expires = Clock::system().now().addingSeconds(seconds);
+        _ends = secondsSinceBoot() + seconds;
     }
     if (const auto client = _client.lock()) client->tokens.set(_endpoint->absoluteString(), token);
     return true;
@@ -239,7 +247,7 @@ bool StoreLock::locked() const {
 
 Date StoreLock::expires() const {
     std::lock_guard guard(_mutex);
-    return _token.empty() ? Clock::system().now().addingSeconds(lockTimeout()) : _expires;
+    return _clock.now().addingSeconds(_token.empty() ? lockTimeout() : _ends - secondsSinceBoot());
 }
 
 std::shared_ptr<CXWebDAVLock> makeStoreLock(CXDAVManager& manager, const Url& url) {

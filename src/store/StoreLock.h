@@ -27,10 +27,12 @@ private:
     std::string _directory;
 };
 
-// A WebDAV write lock of depth 0 (RFC 4918 sections 6 and 9.10).
+// A WebDAV write lock of depth 0 (RFC 4918 sections 6 and 9.10). How long it is good for is measured on a clock that
+// nobody sets and that goes on while the machine sleeps; `clock` only turns that into a date.
 class StoreLock : public CXWebDAVLock {
 public:
-    StoreLock(std::shared_ptr<CXDAVManager::Impl> client, Url name, LockLedger ledger);
+    StoreLock(std::shared_ptr<CXDAVManager::Impl> client, Url name, LockLedger ledger,
+              const Clock& clock = Clock::system());
 
     bool tryLock() override;
     void unlock() override;
@@ -49,10 +51,11 @@ private:
     const Url _name;
     std::optional<Url> _endpoint;
     LockLedger _ledger;
+    const Clock& _clock;
     std::mutex _calls;         // one call at a time
     mutable std::mutex _mutex; // guards the following
     LockToken _token;
-    Date _expires;
+    double _ends = 0; // seconds since boot
 };
 
 } // namespace rolvane

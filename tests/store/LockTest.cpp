@@ -127,6 +127,17 @@ TEST_F(Locks, ALockThatIsHeldIsNotTakenOverByAnotherObjectOfTheSameClient) {
     mine->unlock();
 }
 
+TEST_F(Locks, AClockThatIsSetMeanwhileNeitherShortensNorLengthensIt) {
+    ManualClock clock(Date(1800000000));
+    StoreLock mine(alice.manager.impl(), alice.at("dateFile"), LockLedger(""), clock);
+    ASSERT_TRUE(mine.tryLock());
+    for (const double jump : {0.0, -86400.0, 3 * 86400.0}) {
+        clock.advance(jump);
+        EXPECT_NEAR(mine.expires().secondsSince(clock.now()), CXWebDAVLock::lockTimeout(), 5) << jump;
+    }
+    mine.unlock();
+}
+
 TEST_F(Locks, AnUnheldLockNeverLooksSoonToExpire) {
     auto mine = lock(alice);
     EXPECT_GT(mine->expires().secondsSince(Clock::system().now()), CXWebDAVLock::lockTimeout() - 5);
