@@ -105,9 +105,11 @@ LockToken tokenInHeader(const HttpResponse& answer) {
     return LockToken(text->substr(1, text->size() - 2));
 }
 
-// True when the store has said what became of the lock; a server in trouble has not.
-bool settled(const HttpResponse& answer) {
-    return answer.complete() && answer.status != 401 && answer.status < 500;
+// True when the store has said that it knows the lock no more. A server in trouble, a refusal or somebody else's answer
+// says nothing of it.
+bool isGone(const HttpResponse& answer) {
+    const int status = answer.complete() ? answer.status : 0;
+    return status == 404 || status == 409 || status == 410 || status == 412;
 }
 
 double secondsSinceBoot() {
@@ -163,9 +165,9 @@ bool StoreLock::take(const HttpResponse& answer, const LockToken& known) {
     return true;
 }
 
-// Without an answer the lock may still stand on the store: its token is kept for whoever asks next, the next run
+// Unless it is gone the lock may still stand on the store: its token is kept for whoever asks next, the next run
 // included.
-void StoreLock::lose(bool storeAnswered) {
+void StoreLock::lose(bool gone) {
     LockToken token;
     {
         std::lock_guard guard(_mutex);
@@ -174,8 +176,8 @@ void StoreLock::lose(bool storeAnswered) {
     if (token.empty() || !_endpoint) return;
     const std::string where = _endpoint->absoluteString();
     if (const auto client = _client.lock())
-        storeAnswered ? client->tokens.drop(where, token) : client->tokens.abandon(where, token);
-    if (storeAnswered) _ledger.strike(where);
+        gone ? client->tokens.drop(where, token) : client->tokens.abandon(where, token);
+    if (gone) _ledger.strike(where);
 }
 
 // Of a lock that stands on the store: perhaps it is ours, let go of without the store's hearing of it, or that of an
@@ -219,7 +221,7 @@ bool StoreLock::renew() {
     if (token.empty()) return false;
     const HttpResponse answer = ask(token);
     if (take(answer, token)) return true;
-    lose(settled(answer));
+    lose(isGone(answer));
     return false;
 }
 
@@ -231,13 +233,14 @@ void StoreLock::unlock() {
         token = _token;
     }
     if (token.empty()) return;
-    bool storeAnswered = false;
+    bool gone = false;
     if (const auto client = _client.lock()) {
         HttpRequest r = StoreSession::request("UNLOCK", *_endpoint);
         r.headers = {{"Lock-Token", "<" + token.str() + ">"}};
-        storeAnswered = settled(client->session.send(std::move(r)));
+        const HttpResponse answer = client->session.send(std::move(r));
+        gone = answer.ok() || isGone(answer);
     }
-    lose(storeAnswered);
+    lose(gone);
 }
 
 bool StoreLock::locked() const {

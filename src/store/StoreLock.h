@@ -45,7 +45,7 @@ private:
     HttpResponse ask(const LockToken& refreshed);
     bool take(const HttpResponse& answer, const LockToken& known);
     bool takeOver();
-    void lose(bool storeAnswered);
+    void lose(bool gone);
 
     const std::weak_ptr<CXDAVManager::Impl> _client;
     const Url _name;

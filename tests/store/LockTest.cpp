@@ -101,7 +101,16 @@ TEST_F(Locks, ALockOfARunThatWasKilledIsTakenOverAndOnesOfLivingRunsAreNot) {
 TEST_F(Locks, ALockWhoseReleaseOrRenewalWasNotHeardOfIsTakenOverByTheSameClient) {
     HttpResponse lost;
     lost.error = TransportError::unreachable;
-    for (const auto& [renewed, answer] : {std::pair(false, lost), {true, lost}, {false, answerOf(503)}}) {
+    const HttpResponse redirect = answerOf(302, {{"location", "http://portal.example/"}}, "<html/>");
+    for (const auto& [renewed, answer] : {std::pair(false, lost),
+                                          {true, lost},
+                                          {false, answerOf(503)},
+                                          {false, redirect},
+                                          {true, redirect},
+                                          {false, answerOf(403)},
+                                          {true, answerOf(403)},
+                                          {true, answerOf(200)},
+                                          {false, answerOf(423)}}) {
         auto mine = lock(alice);
         ASSERT_TRUE(mine->tryLock());
         alice.wire->intercept([given = answer](const HttpRequest&) { return std::optional(given); });
