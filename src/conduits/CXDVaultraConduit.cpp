@@ -19,6 +19,7 @@
 namespace rolvane {
 namespace {
 
+constexpr int kOk = 200;
 constexpr int kForbidden = 403;
 // In the prior state of the owner's tree: something was amiss there that may be so for a moment only.
 constexpr const char* kLookAgain = "LookAgain";
@@ -329,7 +330,8 @@ bool CXDVaultraConduit::makeCompositeGroupChange(CXDChangeRecord& record, int& c
     const auto base = baseLocationOf(record);
     if (!base || !record.group()) return false;
     const Url location = layout::groupLocation(*base, *record.group());
-    const auto state = _world.manager.dictionaryAtURL(location, false, &code);
+    auto state = _world.manager.dictionaryAtURL(location, false, &code);
+    if (!state && code == kOk) state = lastKnownState(record);
     const Dictionary changed = layout::groupStateAfterComposite(state.value_or(Dictionary()), contentOf(record));
     // A state that is there and could not be read is not replaced by a part of it: the client then sends no write, and
     // the answer to the read stands.
@@ -337,6 +339,17 @@ bool CXDVaultraConduit::makeCompositeGroupChange(CXDChangeRecord& record, int& c
     const bool done = _world.manager.write(stringForDictionary(changed), location, kSecureRecordWrites, &written);
     if (written != 0) code = written;
     return done;
+}
+
+// In the place of a state file that has come to harm: what it held when it was seen last, as far as such a file says
+// it.
+Dictionary CXDVaultraConduit::lastKnownState(const CXDChangeRecord& record) {
+    if (!record.user() || !record.group()) return {};
+    const Dictionary known = engine().knownGroupState(kConduitVaultra, *record.user(), *record.group());
+    Dictionary state;
+    for (const char* key : {kMemberUIDState, kSubgroupUIDState, kCXGroupNameProperty, kDistributionListState})
+        if (const Value& part = known[key]) state.set(key, part);
+    return state;
 }
 
 bool CXDVaultraConduit::changeGroupName(CXDChangeRecord& record, int& code) {

@@ -32,6 +32,11 @@ public:
     virtual int32_t sourcesForGUID(const UniqueId& group) = 0;
     virtual CXDConduit* conduitForSyncSource(int32_t source) = 0; // none when no conduit serves it
 
+    // What the source is known to hold of a user's group: a copy, empty when nothing is known. Any thread.
+    virtual Dictionary knownGroupState(const std::string& /*conduitID*/, const UserName& /*user*/,
+                                       const UniqueId& /*group*/) {
+        return {};
+    }
     // Whether changes of the user's wait in the stored queue for the source. Reads the whole queue.
     virtual bool hasPendingChanges(const UserName& /*user*/, int32_t /*source*/) { return false; }
 

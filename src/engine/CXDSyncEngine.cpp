@@ -9,6 +9,7 @@
 #include "foundation/CXException.h"
 #include "foundation/FreeMemory.h"
 #include "foundation/Log.h"
+#include "model/PayloadKeys.h"
 
 #include <algorithm>
 #include <filesystem>
@@ -251,6 +252,15 @@ Dictionary CXDSyncEngine::conduitObjectForKey(const std::string& conduitID, cons
 }
 void CXDSyncEngine::setConduitObjectForKey(const std::string& conduitID, const Value& object, const std::string& key) {
     _parts->state.setConduitObjectForKey(conduitID, object, key);
+}
+Dictionary CXDSyncEngine::knownGroupState(const std::string& conduitID, const UserName& user, const UniqueId& group) {
+    Dictionary known;
+    _parts->state.withConduitData([&](Dictionary& data) {
+        const Dictionary users = data[conduitID].dictionary()[kPriorState].dictionary();
+        const Value& state = users[user.str()].dictionary()[group.str()];
+        known = state.deepMutableCopy().dictionary();
+    });
+    return known;
 }
 void CXDSyncEngine::syncPrefs() {
     _parts->state.syncPrefs();

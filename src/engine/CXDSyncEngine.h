@@ -60,6 +60,7 @@ public:
     Dictionary conduitData();
     Dictionary conduitObjectForKey(const std::string& conduitID, const std::string& key) override;
     void setConduitObjectForKey(const std::string& conduitID, const Value& object, const std::string& key) override;
+    Dictionary knownGroupState(const std::string& conduitID, const UserName& user, const UniqueId& group) override;
     void syncPrefs() override;
     CXDChangeRecords getPendingChanges() const;
     bool hasPendingChanges(const UserName& user, int32_t source) override;

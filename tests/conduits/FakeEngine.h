@@ -65,6 +65,10 @@ public:
         return found == conduits.end() ? nullptr : found->second;
     }
 
+    Dictionary knownGroupState(const std::string& conduitID, const UserName& user, const UniqueId& group) override {
+        const std::lock_guard guard(_lock);
+        return priorState(conduitID.c_str())[user.str()].dictionary()[group.str()].deepMutableCopy().dictionary();
+    }
     void updateStateAndExitIfNeeded() override { note("updateStateAndExitIfNeeded"); }
     void checkCXShareCount() override { note("checkCXShareCount"); }
     void applyChangeRecords(const CXDChangeRecords& records) override {

@@ -417,6 +417,28 @@ TEST_F(VaultraConduit, AGroupsStateThatCannotBeReadIsNotReplacedByAPartOfIt) {
     EXPECT_EQ(client->read("G:CXGroup").second.value_or(Dictionary())["memberUIDState"], Value(Array{"a", "b"}));
 }
 
+// A server that lost its power has such files.
+TEST_F(VaultraConduit, AGroupsStateThatCameToHarmIsWrittenAnewFromWhatItHeldLast) {
+    open();
+    engine.priorState(kConduitVaultra)
+        .dictionaryFor("<self>")
+        .set("G:CXGroup", Dictionary{{"memberUIDState", Array{"a", "b"}},
+                                     {kCXGroupNameProperty, "F"},
+                                     {kCXReadWriteSharingACLProperty, Array{"bob"}}});
+    client->write("G:CXGroup", std::string());
+    const auto adds = Dictionary{{"memberAdds", Array{"c"}}};
+    EXPECT_TRUE(apply(record(CXDCompositeGroupChange, nullptr, "G:CXGroup", adds))) << client->wire->text();
+    const Dictionary state = client->read("G:CXGroup").second.value_or(Dictionary());
+    EXPECT_EQ(state["memberUIDState"], Value(Array{"a", "b", "c"}));
+    EXPECT_EQ(state[kCXGroupNameProperty], Value("F"));
+    EXPECT_FALSE(state.contains(kCXReadWriteSharingACLProperty)) << "who may write is nobody else's business";
+
+    std::filesystem::remove(world->file("G:CXGroup"));
+    EXPECT_TRUE(apply(record(CXDCompositeGroupChange, nullptr, "G:CXGroup", adds)));
+    EXPECT_EQ(client->read("G:CXGroup").second.value_or(Dictionary())["memberUIDState"], Value(Array{"c"}))
+        << "what is missing is begun anew";
+}
+
 TEST_F(VaultraConduit, AGroupThatSomebodyElseChangedMeanwhileIsTriedAgainLater) {
     open();
     apply(record(CXDCompositeGroupChange, nullptr, "G:CXGroup", Dictionary{{"memberAdds", Array{"a"}}}));
