@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <cstdlib>
 #include <gtest/gtest.h>
+#include <tuple>
 
 namespace rolvane {
 namespace {
@@ -19,6 +20,7 @@ std::string lockTokenOf(const RawAnswer& answer) {
 // The tree as it should be before each request.
 class MatrixWorld : public AccessWorld {
 public:
+    using AccessWorld::AccessWorld;
     void prepare(bool withLock) {
         releaseLock();
         reset();
@@ -53,16 +55,21 @@ private:
     std::string _token;
 };
 
-class AccessMatrix : public testing::TestWithParam<size_t> {
+class AccessMatrix : public testing::TestWithParam<std::tuple<AccessVariant, size_t>> {
 protected:
-    static void SetUpTestSuite() { world = std::make_unique<MatrixWorld>(); }
     static void TearDownTestSuite() { world.reset(); }
+    void SetUp() override {
+        const AccessVariant variant = std::get<0>(GetParam());
+        if (world && world->variant == variant) return;
+        world.reset();
+        world = std::make_unique<MatrixWorld>(variant);
+    }
     static std::unique_ptr<MatrixWorld> world;
 };
 std::unique_ptr<MatrixWorld> AccessMatrix::world;
 
 TEST_P(AccessMatrix, AnswersAsWrittenDown) {
-    const AccessPlace& place = kAccessPlaces[GetParam()];
+    const AccessPlace& place = kAccessPlaces[std::get<1>(GetParam())];
     const bool locked = std::string(place.name) == "locked file";
     world->prepare(locked);
     for (const AccessRow& row : kAccessMatrix) {
@@ -84,11 +91,37 @@ TEST_P(AccessMatrix, AnswersAsWrittenDown) {
     world->releaseLock();
 }
 
-INSTANTIATE_TEST_SUITE_P(Places, AccessMatrix, testing::Range<size_t>(0, kAccessPlaces.size()), [](const auto& place) {
-    std::string name = kAccessPlaces[place.param].name;
+std::string nameOfRun(const testing::TestParamInfo<std::tuple<AccessVariant, size_t>>& run) {
+    constexpr const char* kVariants[] = {"", "ByDbm", "ByDigest", "WithSanitizers"};
+    std::string name = kAccessPlaces[std::get<1>(run.param)].name;
     std::erase(name, ' ');
-    return name;
-});
+    return name + kVariants[static_cast<int>(std::get<0>(run.param))];
+}
+
+INSTANTIATE_TEST_SUITE_P(Places, AccessMatrix,
+                         testing::Combine(testing::Values(AccessVariant::usual, AccessVariant::digest,
+                                                          AccessVariant::sanitized),
+                                          testing::Range<size_t>(0, kAccessPlaces.size())),
+                         nameOfRun);
+// Another provider changes who is known, and nothing of what they may do.
+INSTANTIATE_TEST_SUITE_P(FirstPlaces, AccessMatrix,
+                         testing::Combine(testing::Values(AccessVariant::dbm), testing::Range<size_t>(0, 3)),
+                         nameOfRun);
+
+TEST(AccessListsByDbm, NameWhomTheProviderKnowsAndNobodyElse) {
+    const AccessWorld world(AccessVariant::dbm);
+    world.reset();
+    using W = AccessWorld;
+    const std::string tree = "/dav/alice/Contacts/";
+    EXPECT_EQ(world.status("alice", "ACL", tree, {}, W::acl(W::ace(W::user("rita"), "read"))), 200);
+    EXPECT_EQ(world.status("rita", "GET", tree + "dateFile"), 200);
+    EXPECT_EQ(world.status("walter", "GET", tree + "dateFile"), 403);
+    EXPECT_EQ(world.status("nobody", "GET", tree + "dateFile"), 401);
+    EXPECT_EQ(world.ask("alice", "ACL", tree, {}, W::acl(W::ace(W::user("nobody"), "read"))).precondition(),
+              "recognized-principal");
+    EXPECT_EQ(world.status("sam", "PROPFIND", "/principals/users/greta", {{"Depth", "0"}}), 207);
+    EXPECT_EQ(world.status("sam", "PROPFIND", "/principals/users/nobody", {{"Depth", "0"}}), 404);
+}
 
 TEST(AccessMatrixDocument, IsThatOfTheTests) {
     const std::string path = ROLVANE_SOURCE_DIR "/docs/access-matrix.md";

@@ -1,18 +1,67 @@
 #include "AccessWorld.h"
 
 #include "foundation/Paths.h"
+#include "server/StoreConfiguration.h"
 
+#include <gtest/gtest.h>
+
+#include <cstdlib>
 #include <sstream>
+#include <stdexcept>
 
 namespace rolvane {
 namespace {
 
-PrivateStoreOptions complete(const StoreDirectory& directory, PrivateStoreOptions options) {
+constexpr const char* kUsers[] = {"alice", "walter", "rita", "sam", "greta"};
+
+void replaceAll(std::string& text, const std::string& from, const std::string& to) {
+    for (size_t at = 0; (at = text.find(from, at)) != std::string::npos; at += to.size())
+        text.replace(at, from.size(), to);
+}
+
+// The store's own configuration, with another provider in the place of the text file.
+std::string withDbm(std::string text) {
+    replaceAll(text, "mod_authn_file.so", "mod_authn_dbm.so");
+    replaceAll(text, "authn_file_module", "authn_dbm_module");
+    replaceAll(text, "AuthBasicProvider file", "AuthBasicProvider dbm");
+    replaceAll(text, "DavAclUsers file", "DavAclUsers dbm");
+    replaceAll(text, "AuthUserFile \"@STATE@/conf/passwords\"",
+               "AuthDBMType SDBM\nAuthDBMUserFile \"@STATE@/conf/users\"");
+    return text;
+}
+
+PrivateStoreOptions complete(AccessVariant variant, const StoreDirectory& directory, PrivateStoreOptions options) {
     options.stateDirectory = directory.path("store");
     options.ownsProcess = true;
     options.tls = false;
+    if (variant == AccessVariant::digest) options.authentication = StoreAuthentication::digest;
+    if (variant == AccessVariant::dbm) {
+        options.configurationTemplate = directory.path("httpd.conf.in");
+        writeFileDurably(options.configurationTemplate, withDbm(readFile(storeTemplatePath())));
+    }
+    if (variant == AccessVariant::sanitized) options.accessModule = ROLVANE_SANITIZED_DAVACL;
     return options;
 }
+
+// What httpd inherits when it starts: it was itself built without sanitizers, so it loads them before everything else.
+class Sanitizers {
+public:
+    explicit Sanitizers(bool wanted) : _wanted(wanted) {
+        if (!_wanted) return;
+        setenv("LD_PRELOAD", ROLVANE_SANITIZERS, 1);
+        setenv("ASAN_OPTIONS", "detect_leaks=0", 1); // httpd's own
+        setenv("UBSAN_OPTIONS", "print_stacktrace=1", 1);
+    }
+    ~Sanitizers() {
+        if (!_wanted) return;
+        for (const char* name : {"LD_PRELOAD", "ASAN_OPTIONS", "UBSAN_OPTIONS"}) unsetenv(name);
+    }
+    Sanitizers(const Sanitizers&) = delete;
+    Sanitizers& operator=(const Sanitizers&) = delete;
+
+private:
+    const bool _wanted;
+};
 
 } // namespace
 
@@ -22,10 +71,32 @@ const std::string AccessWorld::kLock =
 const std::string AccessWorld::kPatch = "<D:propertyupdate xmlns:D=\"DAV:\"><D:set><D:prop><x xmlns=\"urn:x\">1</x>"
                                         "</D:prop></D:set></D:propertyupdate>";
 
-AccessWorld::AccessWorld(PrivateStoreOptions options) : store(complete(directory, std::move(options))) {
-    for (const char* name : {"alice", "walter", "rita", "sam", "greta"}) store.addUser(name, rawPasswordOf(name));
+AccessWorld::AccessWorld(AccessVariant theVariant, PrivateStoreOptions options)
+    : variant(theVariant), store(complete(variant, directory, std::move(options))) {
+    makeUsers();
     writeFileDurably(store.stateDirectory() + "/conf/groups", "# friends\nreaders: greta\nothers: sam walter\n");
+    const Sanitizers inherited(variant == AccessVariant::sanitized);
     store.start();
+}
+
+AccessWorld::~AccessWorld() {
+    if (variant != AccessVariant::sanitized) return;
+    store.stop();
+    std::string said;
+    for (const char* name : {"/logs/error.log", "/logs/startup.log"}) said += readFile(store.stateDirectory() + name);
+    for (const char* word : {"Sanitizer", "runtime error"}) EXPECT_EQ(said.find(word), std::string::npos) << said;
+}
+
+void AccessWorld::makeUsers() {
+    for (const char* name : kUsers) store.addUser(name, rawPasswordOf(name));
+    if (variant != AccessVariant::dbm) return;
+    const std::string file = store.stateDirectory() + "/conf/users";
+    for (const char* name : kUsers) {
+        const char* how = name == kUsers[0] ? "-cbm" : "-bm";
+        const CommandResult made = runCommand({"htdbm", how, "-TSDBM", file, name, rawPasswordOf(name)});
+        if (made.status != 0) throw std::runtime_error("htdbm: " + made.errors);
+    }
+    writeFileDurably(store.stateDirectory() + "/conf/passwords", "", 0600); // nobody is known by it
 }
 
 RawAnswer AccessWorld::ask(const std::string& who, const std::string& method, const std::string& path,
@@ -33,7 +104,12 @@ RawAnswer AccessWorld::ask(const std::string& who, const std::string& method, co
     for (auto& [name, value] : headers)
         if (name == "Destination" && value.starts_with('/'))
             value.insert(0, "http://localhost:" + std::to_string(port()));
-    return rawRequest(port(), {who, method, path, std::move(headers), body});
+    if (variant != AccessVariant::digest || who.empty())
+        return rawRequest(port(), {who, method, path, std::move(headers), body});
+    RawRequest request{"", method, path, std::move(headers), body};
+    if (_nonce.empty()) _nonce = nonceIn(rawRequest(port(), {"", "GET", "/principals/"}));
+    request.headers.emplace_back("Authorization", rawDigest(who, request, _nonce));
+    return rawRequest(port(), request);
 }
 
 std::string AccessWorld::ace(const std::string& principal, const std::string& privileges, const std::string& more) {

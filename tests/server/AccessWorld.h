@@ -8,12 +8,18 @@
 
 namespace rolvane {
 
+// How users are known there: by Basic from a text file as usual, by Basic from a DBM file and nothing else, by Digest.
+// And as usual with a module that was built with AddressSanitizer and UndefinedBehaviorSanitizer.
+enum class AccessVariant { usual, dbm, digest, sanitized };
+
 // A private store on plain HTTP with the users alice (who owns the tree /dav/alice/Contacts), walter (may write it),
 // rita (may read it), sam (a stranger with a tree of his own) and greta (a member of the group readers, which may
 // read).
 class AccessWorld {
 public:
-    explicit AccessWorld(PrivateStoreOptions options = {});
+    explicit AccessWorld(AccessVariant variant = AccessVariant::usual, PrivateStoreOptions options = {});
+    explicit AccessWorld(PrivateStoreOptions options) : AccessWorld(AccessVariant::usual, std::move(options)) {}
+    ~AccessWorld(); // fails the test when a sanitizer had something to say
 
     // A Destination may be given as a path.
     RawAnswer ask(const std::string& user, const std::string& method, const std::string& path,
@@ -36,8 +42,13 @@ public:
     static std::string propfind(const std::string& names);
     static const std::string kLock, kPatch;
 
+    const AccessVariant variant;
     StoreDirectory directory;
     PrivateStore store;
+
+private:
+    void makeUsers();
+    mutable std::string _nonce; // the server's, for Digest
 };
 
 } // namespace rolvane

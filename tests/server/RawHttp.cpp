@@ -1,7 +1,12 @@
 #include "RawHttp.h"
 
+#include "server/StoreConfiguration.h"
+
 #include <arpa/inet.h>
+#include <atomic>
+#include <cstdio>
 #include <netinet/in.h>
+#include <openssl/evp.h>
 #include <stdexcept>
 #include <sys/socket.h>
 #include <sys/time.h>
@@ -22,6 +27,18 @@ std::string base64(const std::string& text) {
     if (held) out += digits[bits << (6 - held) & 63];
     while (out.size() % 4) out += '=';
     return out;
+}
+
+std::string md5(const std::string& text) {
+    unsigned char digest[EVP_MAX_MD_SIZE];
+    unsigned int length = 0;
+    EVP_Digest(text.data(), text.size(), digest, &length, EVP_md5(), nullptr);
+    std::string hex;
+    for (unsigned int i = 0; i < length; ++i) {
+        constexpr char kDigits[] = "0123456789abcdef";
+        hex += {kDigits[digest[i] >> 4], kDigits[digest[i] & 15]};
+    }
+    return hex;
 }
 
 int connectTo(int port) {
@@ -71,6 +88,25 @@ RawAnswer receive(int s) {
 
 std::string rawPasswordOf(const std::string& user) {
     return "secret of " + user;
+}
+
+std::string nonceIn(const RawAnswer& answer) {
+    const std::string mark = " nonce=\"";
+    const size_t at = answer.headers.find(mark);
+    if (at == std::string::npos) throw std::runtime_error("the store does not ask for Digest: " + answer.headers);
+    const size_t from = at + mark.size();
+    return answer.headers.substr(from, answer.headers.find('"', from) - from);
+}
+
+std::string rawDigest(const std::string& user, const RawRequest& request, const std::string& nonce) {
+    static std::atomic<unsigned> uses = 0; // of a nonce, counted on over all of them
+    char count[9];
+    std::snprintf(count, sizeof count, "%08x", ++uses);
+    const std::string secret = md5(user + ":" + kStoreRealm + ":" + rawPasswordOf(user));
+    const std::string what = md5(request.method + ":" + request.path);
+    const std::string response = md5(secret + ":" + nonce + ":" + count + ":c:auth:" + what);
+    return "Digest username=\"" + user + "\", realm=\"" + kStoreRealm + "\", nonce=\"" + nonce + "\", uri=\"" +
+           request.path + "\", algorithm=MD5, qop=auth, cnonce=\"c\", nc=" + count + ", response=\"" + response + "\"";
 }
 
 std::string RawAnswer::precondition() const {

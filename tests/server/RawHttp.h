@@ -24,6 +24,10 @@ struct RawRequest {
     std::string body = {};
 };
 RawAnswer rawRequest(int port, const RawRequest& request);
+// Digest authentication (RFC 7616 with MD5 and qop "auth"): the nonce of a 401, and the value of the header
+// Authorization.
+std::string nonceIn(const RawAnswer& answer);
+std::string rawDigest(const std::string& user, const RawRequest& request, const std::string& nonce);
 std::string rawPasswordOf(const std::string& user);
 
 // A request of which the head and some of the body are sent, and the rest when asked.
