@@ -91,8 +91,10 @@ void CXDCXConduit::close() {
 CXDChangeRecords CXDCXConduit::changeRecords() {
     engine().checkCXShareCount();
     const Date since = _lastSyncDate.value_or(Date::distantPast());
-    const Scan scan{rolvane().journalPosition(), since};
     const bool everything = forgetWhatIsPublishedAgain();
+    // The journal's end and the rows are of one moment: a save is either before both or behind both.
+    const CXRolvane::OneMoment moment(rolvane());
+    const Scan scan{rolvane().journalPosition(), since};
     const Date ownSince = everything ? Date::distantPast() : since;
 
     ChangeCapture capture = newCapture();

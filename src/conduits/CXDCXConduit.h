@@ -31,9 +31,10 @@ class Preferences;
 // a notification whose sender is this process, and compares against a prior state that the engine keeps up to date as
 // records are applied.
 //
-// A full scan and the journal of saves divide the work like this: the scan notes the journal's end before it reads, and
-// when the pass has stored what the scan captured, `close` moves the journal's cursor there. A save that comes while
-// the scan or the pass runs lies behind that mark and is delivered after the pass, however the two dates compare.
+// A full scan and the journal of saves divide the work like this: the scan notes the journal's end, reads the database
+// as it is at that moment, and when the pass has stored what the scan captured, `close` moves the journal's cursor
+// there. A save that comes while the scan or the pass runs lies behind that mark and is delivered after the pass,
+// however the two dates compare.
 class CXDCXConduit : public CXDConduit {
 public:
     static constexpr const char* kLastSyncDateKey = "CXDCXConduitLastSyncDate";

@@ -15,6 +15,7 @@
 namespace rolvane {
 
 class Preferences;
+class SqliteSnapshot;
 
 // One row, read without making a record object. Borrowed for the time of the call that it is handed to; copying is
 // cheap.
@@ -112,6 +113,21 @@ public:
     std::vector<CXListing> listPeople(const std::optional<RemoteLocation>& location, std::string_view text = {});
     std::vector<CXListing> listGroups(const std::optional<RemoteLocation>& location); // by name
     size_t countPeople(const std::optional<RemoteLocation>& location);
+
+    // While it lives, everything that this object reads is of one moment, that of the first reading: what other
+    // processes save meanwhile does not show, and is not held up. Nothing may be saved with this object meanwhile.
+    // Short lived, as the file grows with what others save.
+    class OneMoment {
+    public:
+        explicit OneMoment(CXRolvane& rolvane);
+        ~OneMoment();
+        OneMoment(const OneMoment&) = delete;
+        OneMoment& operator=(const OneMoment&) = delete;
+
+    private:
+        CXRolvane& _rolvane;
+        std::unique_ptr<SqliteSnapshot> _snapshot;
+    };
 
     // The unit of work -----------------------------------------------------------------------------------------------
     // Writes all unsaved changes in one transaction with one journal entry a record, then tells the other processes.

@@ -9,6 +9,16 @@
 
 namespace rolvane {
 
+CXRolvane::OneMoment::OneMoment(CXRolvane& rolvane) : _rolvane(rolvane) {
+    std::lock_guard lock(_rolvane._impl->mutex);
+    _snapshot = std::make_unique<SqliteSnapshot>(_rolvane._impl->sqlite);
+}
+
+CXRolvane::OneMoment::~OneMoment() {
+    std::lock_guard lock(_rolvane._impl->mutex);
+    _snapshot.reset();
+}
+
 namespace {
 
 const Dictionary kNoProperties;

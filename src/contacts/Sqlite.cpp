@@ -209,11 +209,13 @@ void SqliteTransaction::commit() {
     _open = false;
 }
 
-SqliteSnapshot::SqliteSnapshot(Sqlite& database) : _database(database) {
-    _database.statement("BEGIN").run();
+SqliteSnapshot::SqliteSnapshot(Sqlite& database)
+    : _database(database), _isOuter(sqlite3_get_autocommit(database._handle) != 0) {
+    if (_isOuter) _database.statement("BEGIN").run();
 }
 
 SqliteSnapshot::~SqliteSnapshot() {
+    if (!_isOuter) return;
     try {
         _database.statement("COMMIT").run();
     } catch (const CXException&) {

@@ -69,6 +69,7 @@ public:
 private:
     friend class Statement;
     friend class SqliteTransaction;
+    friend class SqliteSnapshot;
     std::shared_ptr<Prepared> prepare(std::string_view sql);
 
     std::string _path;
@@ -91,7 +92,7 @@ private:
     bool _open = true;
 };
 
-// One unchanging view for several reads.
+// One unchanging view for several reads: that of the first of them. Inside another one it is part of that.
 class SqliteSnapshot {
 public:
     explicit SqliteSnapshot(Sqlite& database);
@@ -101,6 +102,7 @@ public:
 
 private:
     Sqlite& _database;
+    const bool _isOuter;
 };
 
 } // namespace rolvane

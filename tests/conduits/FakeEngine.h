@@ -6,6 +6,7 @@
 
 #include <algorithm>
 #include <atomic>
+#include <functional>
 #include <map>
 #include <mutex>
 #include <string>
@@ -19,6 +20,7 @@ namespace rolvane::test {
 class FakeEngine : public ConduitEngine {
 public:
     UserName userForRemoteLocation(const RemoteLocation& location) const override {
+        if (whenAskedForAUser) std::exchange(whenAskedForAUser, nullptr)();
         const auto user = rolvane::userForRemoteLocation(location, account, account.str());
         if (!user) note("kill " + location.str());
         return user.value_or(UserName());
@@ -77,6 +79,8 @@ public:
     }
     void bringSourcesUpToDate() override { note("bringSourcesUpToDate"); }
     void cancel() override { note("cancel"); }
+
+    mutable std::function<void()> whenAskedForAUser; // once
 
     std::vector<std::string> takeCalls() {
         const std::lock_guard guard(_lock);

@@ -207,6 +207,38 @@ TEST_F(Journal, AnEditDuringThePassIsDeliveredAfterIt) {
     EXPECT_EQ(lines(engine.applied).at(0), "1 <self> " + uid(ada) + " - 4");
 }
 
+// In the middle of the scan: after its first comparison and before it reads any person.
+TEST_F(Journal, AnEditSavedWhileAScanReadsIsDeliveredOnceAndNotScanned) {
+    publishAll();
+    const auto ben = person("Ben");
+    const auto friends = group("Friends", {ben});
+    save();
+    database.deliverExternalChanges();
+    const auto theirs = application();
+    const auto theirBen = std::dynamic_pointer_cast<CXPerson>(theirs->recordForUniqueId(ben->uniqueId()));
+    CXPersonRef ada;
+    engine.whenAskedForAUser = [&] {
+        theirBen->setValue(Value("Benjamin"), kCXFirstNameProperty);
+        std::dynamic_pointer_cast<CXGroup>(theirs->recordForUniqueId(friends->uniqueId()))->removeMember(theirBen);
+        ada = edit(*theirs, "Ada");
+    };
+    conduit->open();
+    std::string scanned;
+    for (const CXDChangeRecordPtr& record : conduit->changeRecords())
+        scanned += record->description() + Value(record->payload()).description() + "\n";
+    ASSERT_TRUE(ada) << "nothing was saved during the scan";
+    EXPECT_EQ(scanned.find("Benjamin"), std::string::npos) << scanned;
+    EXPECT_EQ(scanned.find(uid(ada)), std::string::npos) << scanned;
+    EXPECT_NE(scanned.find("\"Ben\""), std::string::npos) << "as it was";
+    clock.advance(1);
+    conduit->close();
+    ASSERT_TRUE(database.deliverExternalChanges());
+    EXPECT_EQ(std::count(seen.begin(), seen.end(), ada->uniqueId().str()), 1);
+    EXPECT_EQ(std::count(seen.begin(), seen.end(), ben->uniqueId().str()), 1);
+    EXPECT_FALSE(database.deliverExternalChanges());
+    EXPECT_EQ(ben->valueForProperty(kCXFirstNameProperty), Value("Benjamin")) << "the moment is over";
+}
+
 TEST_F(Journal, AnEditBehindTheScansMarkIsDeliveredAfterThePass) {
     publishAll();
     save();
