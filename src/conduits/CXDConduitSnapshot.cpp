@@ -20,6 +20,7 @@ namespace {
 
 constexpr int kForbidden = 403;
 constexpr int kNotFound = 404;
+constexpr uint64_t kLargestFile = 64u << 20; // bytes; as much of an answer as is ever read
 constexpr std::string_view kGroupSuffix = "CXGroup";
 constexpr std::string_view kPersonSuffix = "CXPerson";
 
@@ -133,6 +134,8 @@ std::optional<Dictionary> CXDConduit::fetchWorkingStateForSubscription(const Url
         if (!isGroup && !name.ends_with(kPersonSuffix)) continue;
         if (!layout::isASoundName(name)) {
             CXLog("An entry with a strange name in %@ is left out: %@", base, shown(name));
+        } else if (file.size > kLargestFile) {
+            CXLog("An entry in %@ is too large to be read and left out: %@", base, shown(name));
         } else if (isGroup) {
             Dictionary groupState;
             if (file.modificationdate) {
@@ -147,15 +150,42 @@ std::optional<Dictionary> CXDConduit::fetchWorkingStateForSubscription(const Url
     return state;
 }
 
+namespace {
+
+// A list says what somebody has written into it. Names that no member can have are left out, with one line a list.
+void leaveStrangeNamesOut(Dictionary& groupState, const Url& location) {
+    size_t strange = 0;
+    std::string example;
+    for (const char* key : {kMemberUIDState, kSubgroupUIDState}) {
+        const Array* listed = groupState[key].arrayIf();
+        if (!listed) continue;
+        Array sound;
+        for (const Value& name : *listed) {
+            if (layout::isASoundName(name.string()) && layout::isARecordsName(UniqueId(name.string())))
+                sound.append(name);
+            else if (++strange == 1)
+                example = name.string();
+        }
+        if (sound.count() != listed->count()) groupState.set(key, sound);
+    }
+    if (strange != 0)
+        CXLog("%d strange names in the list %@ are left out, the first of them: %@", static_cast<int>(strange),
+              location, shown(example));
+}
+
+} // namespace
+
 bool CXDConduit::readGroup(const Url& base, const std::string& name, Dictionary& groupState) {
     const Url location = base.cxURLByAppendingComponent(name);
     int code = 0;
     const auto content = defaultManager()->dictionaryAtURL(location, &code, false);
-    if (content)
-        groupState.addEntriesFrom(*content);
-    else
+    if (!content) {
         CXLog("Could not get group info at: %@, error: %d", location, code);
-    return content.has_value();
+        return false;
+    }
+    groupState.addEntriesFrom(*content);
+    leaveStrangeNamesOut(groupState, location);
+    return true;
 }
 
 // -- the comparison

@@ -279,7 +279,7 @@ bool CXDVaultraConduit::applyChangeRecord(const CXDChangeRecordPtr& record, bool
     if (denied) *denied = false;
     if (_vaultraOffLine || !lockStructureForRecord(*record)) return false;
     int code = 0;
-    const bool applied = apply(*record, code);
+    const bool applied = mayBeNamed(record) ? apply(*record, code) : true;
     if (denied) *denied = code == kForbidden;
     return applied;
 }
@@ -291,10 +291,21 @@ void CXDVaultraConduit::wasRefused(const CXDChangeRecord& record) {
         _world.manager.forgetVersion(layout::contactLocation(*base, *record.person()));
 }
 
+// Identifiers also come out of other people's lists: one that names the tree's own files would destroy those. What has
+// such a name stays where it is, and its change does not wait for ever.
+bool CXDVaultraConduit::mayBeNamed(const CXDChangeRecordPtr& record) {
+    for (const auto& name : {record->person(), record->group()}) {
+        if (!name || layout::isARecordsName(*name)) continue;
+        CXLog("\"%@\" is a name of the published tree's own, and no contact or group can be kept under it. The change "
+              "stays in this database: %@",
+              *name, record->description());
+        engine().noteRefused(record);
+        return false;
+    }
+    return true;
+}
+
 bool CXDVaultraConduit::apply(CXDChangeRecord& record, int& code) {
-    // Identifiers also come out of other people's lists: one that names the tree's own files would destroy those.
-    for (const auto& name : {record.person(), record.group()})
-        if (name && !layout::isARecordsName(*name)) return false;
     switch (record.type()) {
     case CXDUpdateRecord: return updateRecord(record, code);
     case CXDCreateStructureForGroup: return createStructureForGroup(record, code);

@@ -113,6 +113,7 @@ private:
     int testReachability(); // sets _vaultraOffLine; the error's code, 0 when there was none
     std::optional<Url> baseLocationOf(const CXDChangeRecord& record) const;
 
+    bool mayBeNamed(const CXDChangeRecordPtr& record); // else it is refused for good
     // Each writes one kind of change and sets the result code to the last request's HTTP status.
     bool apply(CXDChangeRecord& record, int& code);
     bool updateRecord(CXDChangeRecord& record, int& code);

@@ -236,10 +236,10 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
     _queueStored = true;
     const bool lookAgain = noteUnsettled() && _pendingChanges.empty();
     _pendingChanges.clear();
-    if (!_parts.denied.empty()) {
-        _parts.state.noteRefusedChanges(_parts.denied.all(), _parts.with.clock.now());
-        for (const CXDChangeRecordPtr& record : _parts.denied.all()) _parts.conduits.vaultra->wasRefused(*record);
-    }
+    for (const CXDChangeRecordPtr& record : _parts.denied.all()) _parts.conduits.vaultra->wasRefused(*record);
+    CXDChangeRecords refused = _parts.denied.all();
+    append(refused, _parts.state.takeRefused());
+    if (!refused.empty()) _parts.state.noteRefusedChanges(refused, _parts.with.clock.now());
     if (!_parts.denied.empty() || lookAgain) {
         _parts.denied.clear();
         if (allowRetry) _actions.scheduleRetry();

@@ -313,6 +313,9 @@ CXDConduit* CXDSyncEngine::conduitForSyncSource(int32_t source) {
 
 // -- conflicts, cache, locks, revocation
 
+void CXDSyncEngine::noteRefused(const CXDChangeRecordPtr& record) {
+    _parts->state.noteRefused(record);
+}
 bool CXDSyncEngine::shouldChangeRecordBeCanceled(const CXDChangeRecord& record) const {
     return _parts->denied.contains(record);
 }

@@ -77,6 +77,7 @@ public:
     CXDConduit* conduitForSyncSource(int32_t source) override;
 
     // Conflicts, cache, locks, revocation.
+    void noteRefused(const CXDChangeRecordPtr& record) override;
     bool shouldChangeRecordBeCanceled(const CXDChangeRecord& record) const override;
     void cancelPendingChangesLike(const CXDChangeRecordPtr& denied, const CXDChangeRecords& amongst);
     Dictionary payloadMerging(const Dictionary& first, const Dictionary& into);

@@ -98,6 +98,16 @@ void EngineState::noteRefusedChanges(const CXDChangeRecords& records, Date when)
     _preferences.set(kDaemonDomain, kCXDRefusedChanges, notes);
 }
 
+void EngineState::noteRefused(const CXDChangeRecordPtr& record) {
+    const std::lock_guard guard(_lock);
+    _refused.push_back(record);
+}
+
+CXDChangeRecords EngineState::takeRefused() {
+    const std::lock_guard guard(_lock);
+    return std::exchange(_refused, {});
+}
+
 void EngineState::setRemoteLocationForSubscriptionUID(const std::optional<RemoteLocation>& location,
                                                       const std::optional<UniqueId>& subscription) {
     if (!location || !subscription) return;

@@ -48,6 +48,9 @@ public:
 
     // Adds what a pass was refused; the oldest are forgotten. Without synchronising.
     void noteRefusedChanges(const CXDChangeRecords& records, Date when);
+    // What a pass meets on its way, for that note. Any thread; in memory only.
+    void noteRefused(const CXDChangeRecordPtr& record);
+    CXDChangeRecords takeRefused();
 
     // Subscription identifier to remote location. Nothing happens when one of the two is missing.
     void setRemoteLocationForSubscriptionUID(const std::optional<RemoteLocation>& location,
@@ -68,7 +71,8 @@ private:
 
     Preferences& _preferences;
     std::mutex _lock;
-    std::optional<Dictionary> _conduitData; // guarded by _lock
+    std::optional<Dictionary> _conduitData; // guarded by _lock, as is
+    CXDChangeRecords _refused;
 };
 
 } // namespace rolvane

@@ -213,7 +213,8 @@ public:
         engine.account = UserName("alice");
     }
     std::set<Deviation> deviations() const override {
-        return {Deviation::KeepsMemberMarkers, Deviation::ForgetsOtherInfoOnRename, Deviation::KnowsNoSubgroups};
+        return {Deviation::KeepsMemberMarkers, Deviation::ForgetsOtherInfoOnRename, Deviation::KnowsNoSubgroups,
+                Deviation::RefusesTheTreesNamesForGood};
     }
     std::unique_ptr<CXDConduit> makeConduit() override {
         return std::make_unique<CXDVaultraConduit>(engine, CXDVaultraConduit::World{_client.manager, _network,

@@ -32,6 +32,7 @@ enum class Deviation {
     CallsTheOwnerByTheMarker,     // "<self>" has no other name there
     HasNoLocations,               // nobody's data lives at a URL there; so no location of it can be revoked
     TakesAnyName,                 // names are no names of files there
+    RefusesTheTreesNamesForGood,  // a record that is called like the tree's own files does not wait for another time
     HasNoCompositeChange,         // the change is refused
     KeepsMembersAsKeys,           // a composite change has keys of its own, and the members stand as keys
     WritesContactsBesideTheirURL, // a contact is not where its location says

@@ -54,6 +54,7 @@ public:
     bool shouldChangeRecordBeCanceled(const CXDChangeRecord& record) const override {
         return canceledUser && record.user() == canceledUser;
     }
+    void noteRefused(const CXDChangeRecordPtr& record) override { refused.push_back(record); }
     bool lockURL(const Url& url) override {
         note("lock " + url.absoluteString());
         return locks;
@@ -81,6 +82,7 @@ public:
     void cancel() override { note("cancel"); }
 
     mutable std::function<void()> whenAskedForAUser; // once
+    CXDChangeRecords refused;
 
     std::vector<std::string> takeCalls() {
         const std::lock_guard guard(_lock);

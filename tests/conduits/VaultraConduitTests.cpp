@@ -488,13 +488,23 @@ TEST_F(VaultraConduit, RecordsWithoutWhatTheyNameFailAndSendNothing) {
     EXPECT_EQ(client->wire->methods(), "");
 }
 
-TEST_F(VaultraConduit, ARecordThatIsCalledLikeTheTreesOwnFilesTouchesNothing) {
+TEST_F(VaultraConduit, ARecordThatIsCalledLikeTheTreesOwnFilesTouchesNothingAndIsRefusedForGood) {
     open();
+    const auto refused = [&](const CXDChangeRecordPtr& each, const std::string& name) {
+        engine.refused.clear();
+        log.clear();
+        bool denied = true;
+        EXPECT_TRUE(conduit->applyChangeRecordIfNeeded(each, &denied)) << name << ": it would wait for ever";
+        EXPECT_FALSE(denied) << name << ": the user's other changes are not to go with it";
+        EXPECT_EQ(engine.refused, CXDChangeRecords{each}) << name;
+        EXPECT_EQ(log.lines().size(), 1u) << log.text();
+        EXPECT_NE(log.text().find("\"" + name + "\" is a name of the published tree's own"), std::string::npos);
+    };
     for (const char* name : {"People", "info", "dateFile", "Contacts", ".state", "..", ""}) {
         for (const int type : {CXDCreateStructureForGroup, CXDCompositeGroupChange, CXDChangeGroupName, CXDDeleteGroup})
-            EXPECT_FALSE(conduit->applyChangeRecordIfNeeded(record(type, nullptr, name, Dictionary()))) << name;
-        EXPECT_FALSE(conduit->applyChangeRecordIfNeeded(record(CXDAddRecordToGroup, name, "G:CXGroup"))) << name;
-        EXPECT_FALSE(conduit->applyChangeRecordIfNeeded(record(CXDDeleteRecord, name, nullptr))) << name;
+            refused(record(type, nullptr, name, Dictionary()), name);
+        refused(record(CXDAddRecordToGroup, name, "G:CXGroup"), name);
+        refused(record(CXDDeleteRecord, name, nullptr), name);
     }
     EXPECT_EQ(client->wire->methods(), "");
     EXPECT_TRUE(std::filesystem::is_directory(world->file("People/31")));
