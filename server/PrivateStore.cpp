@@ -276,8 +276,11 @@ void PrivateStore::Implementation::stopLocked(Stop how) {
     unlink(pidFile().c_str());
 }
 
+// httpd reads the passwords at every request, and the access lists ask for no more than a name. Only a store without
+// lists has a section of its configuration for each user.
 void PrivateStore::Implementation::usersChanged(bool wasRunning) {
-    if (!wasRunning) return;
+    const auto started = savedOptions(state);
+    if (!wasRunning || (started && started->keepsAccessLists())) return;
     stopLocked(Stop::atOnce);
     startLocked();
 }

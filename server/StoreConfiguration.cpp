@@ -138,12 +138,13 @@ std::string renderStoreConfiguration(const std::string& templateText, const Priv
 std::string renderStoreUsers(const std::string& davDirectory, const std::vector<std::string>& users,
                              StoreAuthentication authentication, bool accessLists) {
     std::string text;
+    if (accessLists) return text; // the lists say who may do what, in every tree
     for (const auto& user : users) {
         text += "<Directory \"" + davDirectory + "/" + user + "\">\n  ";
         if (authentication == StoreAuthentication::none)
             text += "Require all granted";
         else
-            text += accessLists ? "Require valid-user" : "Require user " + user;
+            text += "Require user " + user;
         text += "\n</Directory>\n";
     }
     return text;

@@ -1,3 +1,4 @@
+#include "RawHttp.h"
 #include "StoreTestWorld.h"
 #include "foundation/CXException.h"
 #include "foundation/Paths.h"
@@ -477,6 +478,42 @@ TEST(PrivateStore, AUserWhoIsAddedWhileItRunsIsServedAtOnce) {
     EXPECT_EQ(CurlClient(world.store, "carol", "c").request("PUT", "/carol/x", {}, "x").status, 201);
     EXPECT_EQ(world.store.status().port, port);
     EXPECT_THAT(world.store.users(), testing::ElementsAre("alice", "bob", "carol"));
+}
+
+TEST(PrivateStore, UsersComeAndGoWithoutARestart) {
+    const StoreDirectory directory;
+    PrivateStoreOptions options = optionsIn(directory);
+    options.tls = false;
+    PrivateStore store(options);
+    store.addUser("alice", rawPasswordOf("alice"));
+    store.start();
+    const PrivateStoreStatus before = store.status();
+    RawUpload upload(before.port, {"alice", "PUT", "/dav/alice/x", {{"Expect", "100-continue"}}, "slow"}, 0);
+    ASSERT_TRUE(upload.awaitContinue());
+    store.addUser("carol", rawPasswordOf("carol"));
+    EXPECT_EQ(rawRequest(before.port, {"carol", "PUT", "/dav/carol/x", {}, "x"}).status, 201);
+    EXPECT_EQ(rawRequest(before.port, {"carol", "PUT", "/dav/alice/y", {}, "x"}).status, 403);
+    EXPECT_EQ(rawRequest(before.port, {"alice", "GET", "/dav/carol/x"}).status, 403);
+    EXPECT_EQ(rawRequest(before.port, {"alice", "COPY", "/dav/alice/", {{"Destination", "/dav/carol/stolen"}}}).status,
+              403);
+    EXPECT_TRUE(store.removeUser("carol"));
+    EXPECT_EQ(rawRequest(before.port, {"carol", "GET", "/dav/carol/x"}).status, 401);
+    EXPECT_EQ(upload.finish().status, 201) << "what is under way is not disturbed";
+    EXPECT_EQ(store.status().pid, before.pid);
+}
+
+TEST(PrivateStore, WithoutAccessListsAUserWhoIsAddedHasATreeNobodyElseMayEnter) {
+    const StoreDirectory directory;
+    PrivateStoreOptions options = optionsIn(directory);
+    options.tls = false;
+    options.accessLists = false;
+    PrivateStore store(options);
+    store.addUser("alice", rawPasswordOf("alice"));
+    store.start();
+    store.addUser("carol", rawPasswordOf("carol"));
+    const int port = store.status().port;
+    EXPECT_EQ(rawRequest(port, {"carol", "PUT", "/dav/carol/x", {}, "x"}).status, 201);
+    EXPECT_EQ(rawRequest(port, {"alice", "GET", "/dav/carol/x"}).status, 403);
 }
 
 TEST(PrivateStore, ANewPasswordReplacesTheOldOneWithoutARestart) {
