@@ -2,6 +2,7 @@
 
 #include "contacts/CXRolvane.h"
 #include "engine/ChangeQueue.h"
+#include "engine/GoneThings.h"
 #include "engine/Mingler.h"
 #include "engine/OutOfOrderWork.h"
 #include "engine/PublicationCache.h"
@@ -120,6 +121,7 @@ void ApplyLoop::applyAll(bool trickle) {
     append(_unhandled, _parts.state.getPendingChanges());
     _queueTaken = true;
     _unsettled = unsettledGroups(_unhandled, fresh);
+    withdrawWhatIsGone(_unhandled, fresh, _parts.with.rolvane);
     queue();
     _parts.with.progress.startedPhase(3);
     split();

@@ -30,7 +30,8 @@ Dictionary unsettledGroups(const CXDChangeRecords& records, size_t fresh) {
         if (record->person() != record->group()) count(*record, record->person());
     }
     for (const auto& [identifier, of] : met)
-        if (of.times > 1) unsettled.set(of.isGroup ? identifier.str() : std::string(kCXAllGroupUID), true);
+        if (of.isGroup || of.times > 1)
+            unsettled.set(of.isGroup ? identifier.str() : std::string(kCXAllGroupUID), true);
     return unsettled;
 }
 

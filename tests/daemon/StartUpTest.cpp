@@ -2,6 +2,7 @@
 
 #include "foundation/Paths.h"
 
+#include <csignal>
 #include <fstream>
 #include <sqlite3.h>
 
@@ -341,6 +342,39 @@ TEST_F(StartUp, AContactDeletedWhileAnOlderEditOfItWaitsLeavesTheStore) {
     for (int i = 0; i < 200 && !settled(); ++i) daemon->wait(0.05);
     EXPECT_EQ(world.pendingChanges(), 0U) << daemon->errors();
     EXPECT_EQ(world.differences(), "") << daemon->errors();
+}
+
+TEST_F(StartUp, WhatIsMadeAndDeletedWhileTheStoreIsAwayNeverStaysThere) {
+    const auto daemon = servingGroups(world);
+    ASSERT_EQ(world.differences(), "") << daemon->errors();
+    world.store().stop(PrivateStore::Stop::atOnce);
+    const CXPersonRef passing = CXPerson::create();
+    passing->setValue("Passing", kCXFirstNameProperty);
+    world.database().addRecord(passing);
+    groupNamed(world, "B:CXGroup")->addMember(passing);
+    const CXGroupRef fleeting = CXGroup::initWithUniqueId(UniqueId("C:CXGroup"));
+    fleeting->setValue("Fleeting", kCXGroupNameProperty);
+    world.database().addRecord(fleeting);
+    fleeting->addMember(passing);
+    world.database().save();
+    for (int i = 0; i < 600 && world.pendingChanges() == 0; ++i) daemon->wait(0.05);
+    ASSERT_GT(world.pendingChanges(), 0U) << daemon->errors();
+    world.database().removeRecord(passing);
+    world.database().removeRecord(fleeting);
+    world.database().save();
+    daemon->signal(SIGTERM);
+    ASSERT_TRUE(daemon->wait());
+
+    world.store().start();
+    std::string log;
+    for (int pass = 0; pass < 2; ++pass) {
+        const auto next = world.startManager({"-p"});
+        ASSERT_TRUE(next->wait());
+        log += next->errors();
+    }
+    EXPECT_EQ(world.differences(), "") << log;
+    EXPECT_FALSE(world.tree().contains("C:CXGroup")) << log;
+    EXPECT_EQ(world.pendingChanges(), 0U);
 }
 
 TEST_F(StartUp, AnEditOfAnotherProcessIsCarriedToTheStore) {

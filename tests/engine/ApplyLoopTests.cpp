@@ -96,6 +96,32 @@ TEST_F(Pass, AppliesWhatWasCarriedOverAfterWhatIsNew) {
     EXPECT_TRUE(world.pending().empty());
 }
 
+TEST_F(Pass, WhatWaitedAndIsGoneFromTheDatabaseIsWithdrawn) {
+    for (const char* uid : {"Kept:CXPerson", "Copy:CXSubscribedPerson"})
+        world.rolvane->addRecord(CXPerson::initWithUniqueId(UniqueId(uid)));
+    world.rolvane->save();
+    const auto waiting = [](int32_t type, const char* person, const char* group, const char* user = "<self>") {
+        return makeRecord(type, person, group, {CXDSyncSourceCX, CXDSyncSourceVaultra, user});
+    };
+    world.engine->setPendingChanges({waiting(CXDUpdateRecord, "Kept:CXPerson", nullptr),
+                                     waiting(CXDUpdateRecord, "Copy:CXPerson", nullptr),
+                                     waiting(CXDUpdateRecord, "Gone:CXPerson", nullptr),
+                                     waiting(CXDUpdateRecord, "Theirs:CXPerson", nullptr, "bob"),
+                                     waiting(CXDCompositeGroupChange, nullptr, "Gone:CXGroup"),
+                                     waiting(CXDCompositeGroupChange, nullptr, "AllCXGroup")});
+    std::mutex lock;
+    std::multiset<std::string> applied;
+    world.vaultra->whenApplying = [&](const CXDChangeRecordPtr& r, bool*) {
+        const std::lock_guard guard(lock);
+        applied.insert((r->person() ? r->person()->str() : r->group()->str()) + " " + std::to_string(r->type()));
+        return true;
+    };
+    trickle({update("Fresh:CXPerson")});
+    EXPECT_EQ(applied, (std::multiset<std::string>{"Kept:CXPerson 1", "Copy:CXPerson 1", "Gone:CXPerson 260",
+                                                   "Theirs:CXPerson 1", "Gone:CXGroup 261", "AllCXGroup 3",
+                                                   "Fresh:CXPerson 1"}));
+}
+
 TEST_F(Pass, SortsByTypeAndKeepsTheOrderOfArrivalWithinOne) {
     world.account.threads = 1;
     trickle({makeRecord(CXDDeleteRecord, "P1", nullptr), update("P2"), update("P3")});
