@@ -3,6 +3,7 @@
 #include "contacts/RolvaneImpl.h"
 
 #include <algorithm>
+#include <set>
 
 namespace rolvane {
 
@@ -13,12 +14,37 @@ std::vector<UniqueId> sharing(std::vector<UniqueId> uids) {
     return uids;
 }
 
-// Is `wanted` the group or below it?
-bool holds(CXRolvane::Impl& d, const UniqueId& group, const UniqueId& wanted, std::set<UniqueId>& seen) {
-    if (group == wanted) return true;
-    if (!seen.insert(group).second) return false;
-    std::vector<UniqueId> below = d.listed(group, true);
-    return std::any_of(below.begin(), below.end(), [&](const UniqueId& g) { return holds(d, g, wanted, seen); });
+// Groups still to be looked at on one way, each once.
+struct Way {
+    explicit Way(const UniqueId& from) : seen{from}, waiting{from} {}
+    UniqueId take() {
+        UniqueId next = std::move(waiting.back());
+        waiting.pop_back();
+        return next;
+    }
+    void add(std::vector<UniqueId> groups) {
+        for (UniqueId& group : groups)
+            if (seen.insert(group).second) waiting.push_back(std::move(group));
+    }
+    std::set<UniqueId> seen;
+    std::vector<UniqueId> waiting;
+};
+
+// Is `wanted` the group or below it? Where that is a long way, it is looked for from both ends, so that the shorter one
+// decides. Without recursion: groups come from other people, too, nested however deep.
+bool holds(CXRolvane::Impl& d, const UniqueId& group, const UniqueId& wanted) {
+    constexpr size_t kLong = 64;
+    Way down(group), up(wanted);
+    while (!down.waiting.empty() && !up.waiting.empty()) {
+        const UniqueId below = down.take();
+        if (below == wanted) return true;
+        down.add(d.listed(below, true));
+        if (down.seen.size() < kLong) continue;
+        const UniqueId above = up.take();
+        if (above == group) return true;
+        up.add(d.parents(above));
+    }
+    return false;
 }
 
 CXSearchElement element(std::string_view table, std::string_view property, std::string_view label, std::string_view key,
@@ -134,8 +160,7 @@ bool CXGroup::addSubgroup(const CXGroupRef& group) {
     std::lock_guard lock(database.impl().mutex);
     if (group->isAllGroup())
         throw CXException(kCXInvalidArgumentException, "An all-contacts group cannot be a subgroup of " + name() + ".");
-    std::set<UniqueId> seen;
-    if (holds(database.impl(), group->uniqueId(), uniqueId(), seen))
+    if (holds(database.impl(), group->uniqueId(), uniqueId()))
         throw CXException(kCXInvalidArgumentException, "The group \"" + group->name() +
                                                            "\" cannot become a subgroup of \"" + name() +
                                                            "\": it would contain itself.");
@@ -146,8 +171,7 @@ bool CXGroup::mayListSubgroup(const CXGroupRef& group) const {
     CXRolvane* database = rolvane();
     if (!database || !group || group->rolvane() != database || group->isAllGroup()) return false;
     std::lock_guard lock(database->impl().mutex);
-    std::set<UniqueId> seen;
-    return isAttached() && group->isAttached() && !holds(database->impl(), group->uniqueId(), uniqueId(), seen);
+    return isAttached() && group->isAttached() && !holds(database->impl(), group->uniqueId(), uniqueId());
 }
 
 bool CXGroup::removeSubgroup(const CXGroupRef& group) {

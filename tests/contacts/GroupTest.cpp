@@ -64,6 +64,23 @@ TEST(Group, RefusesToContainItself) {
     EXPECT_TRUE(c->subgroups().empty());
 }
 
+TEST(Group, RefusesToContainItselfHoweverDeep) {
+    constexpr size_t kLevels = 20000;
+    TestDatabase d;
+    std::vector<CXGroupRef> groups;
+    for (size_t i = 0; i < kLevels; ++i) {
+        groups.push_back(CXGroup::initWithUniqueId(UniqueId(std::to_string(kLevels + i) + ":CXGroup")));
+        d->addRecord(groups.back());
+        if (i > 0) groups[i - 1]->addSubgroup(groups[i]);
+    }
+    d->save();
+    EXPECT_FALSE(groups.back()->mayListSubgroup(groups.front()));
+    EXPECT_FALSE(groups.back()->mayListSubgroup(groups[kLevels / 2]));
+    const CXGroupRef other = d.addGroup("Other");
+    EXPECT_TRUE(groups.back()->mayListSubgroup(other));
+    EXPECT_TRUE(other->mayListSubgroup(groups.front()));
+}
+
 TEST(Group, ACycleThatTwoProcessesMakeTogetherIsNotWritten) {
     TestDatabase d;
     CXGroupRef a = d.addGroup("A"), b = d.addGroup("B");
