@@ -14,6 +14,10 @@ namespace {
 // among many costs far less than a lookup, but not nothing.
 constexpr size_t kFew = 4;
 constexpr size_t kRowsPerLookup = 16;
+// A group is captured with each new group that lists it: so many levels deep, and so often in one gathering. Whatever
+// lies deeper is captured by itself: every all-contacts group lists every group.
+constexpr size_t kDeepest = 200;
+constexpr int kOftenEnough = 64;
 
 UniqueId sharedPerson(const UniqueId& uid) {
     return cxUIDWithTableName(cxNormalizedUID(uid), kCXPersonTable);
@@ -125,7 +129,9 @@ void ChangeCapture::addGroup(const CXGroupRef& group) {
     if (!group) return;
     const auto location = _reader.locationOfGroup(*group);
     if (!location) return;
-    // A group that contains itself, through whatever other process, would be compared without end.
+    // A group that contains itself, through whatever other process, would be compared without end. So would, nearly,
+    // groups of somebody's that contain one another on very many ways; what was captured so often is all there.
+    if (_underway.size() >= kDeepest || ++_comparisons[group->uniqueId()] > kOftenEnough) return;
     const auto [underway, isNew] = _underway.insert(group->uniqueId());
     if (!isNew) return;
     const UniqueId guid = cxUIDWithTableName(group->sharingUniqueId(), kCXGroupTable);

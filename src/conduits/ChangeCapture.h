@@ -73,12 +73,13 @@ private:
     CXDChangeRecords _records;
     std::unordered_map<RemoteLocation, Destination> _destinations;
     std::vector<CapturedPerson> _people;
-    NumberTable _byIdentifier;             // places in _people, by uniqueId
-    mutable size_t _following = 0;         // the place in _people behind the last one that was asked for
-    std::vector<Captured> _places;         // of all people
-    CXDChangeRecords _captured;            // of all people
-    std::unordered_set<UniqueId> _arrived; // members whose data came from their publisher
-    std::set<UniqueId> _underway;          // groups whose comparison is under way, by uniqueId
+    NumberTable _byIdentifier;                      // places in _people, by uniqueId
+    mutable size_t _following = 0;                  // the place in _people behind the last one that was asked for
+    std::vector<Captured> _places;                  // of all people
+    CXDChangeRecords _captured;                     // of all people
+    std::unordered_set<UniqueId> _arrived;          // members whose data came from their publisher
+    std::set<UniqueId> _underway;                   // groups whose comparison is under way, by uniqueId
+    std::unordered_map<UniqueId, int> _comparisons; // how often a group was compared, by uniqueId
 };
 
 } // namespace rolvane

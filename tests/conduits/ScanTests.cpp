@@ -126,6 +126,28 @@ TEST_F(Scan, ClosingSavesTheDatabaseAndMovesTheLastSyncDateToTheEndOfThePass) {
         << "the date is synchronised";
 }
 
+// Each group lists both of the next layer: there are 2^16 ways to the last one.
+TEST_F(Scan, GroupsThatContainOneAnotherOnVeryManyWaysAreCapturedInTime) {
+    constexpr size_t kLayers = 16;
+    publishAll();
+    std::vector<CXGroupRef> layer{group("a"), group("b")}, all = layer;
+    for (size_t i = 1; i < kLayers; ++i) {
+        const std::vector<CXGroupRef> next{group("c"), group("d")};
+        for (const CXGroupRef& above : layer)
+            for (const CXGroupRef& below : next) above->addSubgroup(below);
+        all.insert(all.end(), next.begin(), next.end());
+        layer = next;
+    }
+    save();
+    conduit->open();
+    const CXDChangeRecords records = conduit->changeRecords();
+    EXPECT_LT(records.size(), 20000u);
+    std::set<UniqueId> made;
+    for (const CXDChangeRecordPtr& record : records)
+        if (record->type() == CXDCreateStructureForGroup) made.insert(*record->group());
+    for (const CXGroupRef& each : all) EXPECT_TRUE(made.contains(each->sharingUniqueId()));
+}
+
 TEST_F(Scan, ClosingForgetsRevokedUsers) {
     engine.priorState("CXDCX").set("bob", Dictionary());
     engine.revoked = {kBobsLocation};
