@@ -125,6 +125,7 @@ std::optional<Dictionary> CXDConduit::fetchWorkingStateForSubscription(const Url
     }
     const std::string infoPath = base.cxURLByAppendingComponent(layout::kInfo).path();
     const std::string clockPath = layout::dateFileLocation(base).path();
+    const std::string bucketsPath = base.cxURLByAppendingComponent(layout::kPeople).path() + "/";
     for (const auto& [path, file] : *listing) {
         const std::string name = nameOf(path, file);
         if (file.stored && (path == infoPath || path == clockPath))
@@ -132,7 +133,8 @@ std::optional<Dictionary> CXDConduit::fetchWorkingStateForSubscription(const Url
         if (isASpecialFile(name) || name == layout::kPeople) continue;
         const bool isGroup = name.ends_with(kGroupSuffix);
         if (!isGroup && !name.ends_with(kPersonSuffix)) continue;
-        if (!layout::isASoundName(name)) {
+        // Groups lie beside "People": what is called like one among the contacts could not be read as one.
+        if (!layout::isASoundName(name) || (isGroup && path.starts_with(bucketsPath))) {
             CXLog("An entry with a strange name in %@ is left out: %@", base, shown(name));
         } else if (file.size > kLargestFile) {
             CXLog("An entry in %@ is too large to be read and left out: %@", base, shown(name));

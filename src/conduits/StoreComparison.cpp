@@ -24,11 +24,18 @@ Names namesIn(const Array& array) {
     return names;
 }
 
-// The strings of `array`, in order, that are not among the names.
+// What is shared is never named as somebody's copy of it. Taken at its word, such a name would make a copy that hides
+// the record itself.
+bool isShared(std::string_view name) {
+    return !name.ends_with(kCXSubscribedPersonTable) && !name.ends_with(kCXSubscribedGroupTable);
+}
+
+// The shared names of `array`, in order, that are not among the names.
 Array without(const Array& array, const Names& names) {
     Array rest;
     for (const Value& element : array)
-        if (const std::string* text = element.stringIf(); text && !text->empty() && !names.contains(*text))
+        if (const std::string* text = element.stringIf();
+            text && !text->empty() && isShared(*text) && !names.contains(*text))
             rest.append(element);
     return rest;
 }

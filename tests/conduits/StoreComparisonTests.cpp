@@ -236,6 +236,17 @@ TEST(StoreComparison, AGroupsDifferenceKeepsTheOrdersOfItsSides) {
     EXPECT_EQ(difference["distributionListRemoves"], Value(Array()));
 }
 
+// Somebody may have written such a name into a list. It would make a copy that hides the record itself.
+TEST(StoreComparison, ANameOfACopyInAListCountsAsAbsent) {
+    const Dictionary difference = groupDifference(
+        Dictionary{{"memberUIDState", Array{"b:CXPerson"}}},
+        Dictionary{{"memberUIDState", Array{"b:CXSubscribedPerson", "a:CXPerson", "b:CXPerson"}},
+                   {"subgroupUIDState", Array{"AllCXSubscribedGroup", "s:CXSubscribedGroup", "t:CXGroup"}}});
+    EXPECT_EQ(difference["memberAdds"], Value(Array{"a:CXPerson"}));
+    EXPECT_EQ(difference["memberRemoves"], Value(Array()));
+    EXPECT_EQ(difference["subgroupAdds"], Value(Array{"t:CXGroup"}));
+}
+
 TEST(StoreComparison, TwoAbsentGroupsDifferInNothing) {
     for (const auto& [key, value] : groupDifference({}, {}))
         EXPECT_TRUE(value.array().empty() && value.dictionary().empty()) << key;

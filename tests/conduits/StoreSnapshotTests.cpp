@@ -213,6 +213,17 @@ TEST_F(StoreSnapshot, EntriesWithHostileNamesAreLeftOutWithOneLineEachAndTheRest
     }
 }
 
+TEST_F(StoreSnapshot, AFileAmongTheContactsThatIsCalledLikeAGroupHidesNobody) {
+    publish(kBob, {"a:CXPerson"}, {{"G:CXGroup", Dictionary{{"memberUIDState", Array{"a:CXPerson"}}}}});
+    bobsListing()["/bob/Contacts/People/2/stray:CXGroup"] = {"stray:CXGroup", kSync, 0, {}, false};
+    const auto state = fetch();
+    ASSERT_TRUE(state) << log.text();
+    EXPECT_EQ(people(*state).allKeys(), Texts{"a:CXPerson"});
+    EXPECT_TRUE(state->contains("G:CXGroup"));
+    EXPECT_FALSE(state->contains("stray:CXGroup"));
+    EXPECT_TRUE(log.mentions("An entry with a strange name in " + kBob)) << log.text();
+}
+
 // -- the snapshot of everybody
 
 TEST_F(StoreSnapshot, ReadsTheOwnersOwnPublicationFirstWhenSomethingIsKnownOfItAndThenTheSubscriptions) {
