@@ -49,6 +49,34 @@ Dictionary listOf(const Dictionary& userState) {
     return list;
 }
 
+// The groups of a listing that have to be read are, all at once, for as long as this lives. Large lists are read when
+// it is their turn.
+class ReadingGroupsAhead {
+public:
+    ReadingGroupsAhead(CXFileManager& manager, const Url& base, const FileListing& listing) : _manager(manager) {
+        constexpr uint64_t kLarge = 256u << 10;
+        std::vector<Url> groups;
+        for (const auto& [path, file] : listing) {
+            const std::string name = nameOf(path, file);
+            if (name.ends_with(kGroupSuffix) && layout::isASoundName(name) && file.modificationdate && !file.seen &&
+                file.size < kLarge)
+                groups.push_back(base.cxURLByAppendingComponent(name));
+        }
+        if (groups.size() < 2) return;
+        _expecting = true;
+        _manager.expectReads(groups, false);
+    }
+    ~ReadingGroupsAhead() {
+        if (_expecting) _manager.expectReads({}, false);
+    }
+    ReadingGroupsAhead(const ReadingGroupsAhead&) = delete;
+    ReadingGroupsAhead& operator=(const ReadingGroupsAhead&) = delete;
+
+private:
+    CXFileManager& _manager;
+    bool _expecting = false;
+};
+
 Array arrayOf(const std::vector<UserName>& principals) {
     Array all;
     for (const UserName& principal : principals) all.append(principal);
@@ -123,6 +151,7 @@ std::optional<Dictionary> CXDConduit::fetchWorkingStateForSubscription(const Url
         CXLog("Could not retrieve info for files in subscription: %@", base);
         return std::nullopt;
     }
+    const ReadingGroupsAhead ahead(*manager, base, *listing);
     const std::string infoPath = base.cxURLByAppendingComponent(layout::kInfo).path();
     const std::string clockPath = layout::dateFileLocation(base).path();
     const std::string bucketsPath = base.cxURLByAppendingComponent(layout::kPeople).path() + "/";

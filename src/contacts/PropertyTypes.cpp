@@ -88,6 +88,24 @@ bool isOfType(const Value& value, CXPropertyType type) {
     return false;
 }
 
+bool isText(const Value& value) {
+    return value.isString() && !value.string().empty();
+}
+
+// True for a multi-value that the cleaning would leave as it is.
+bool isCleanMultiValue(const Dictionary& multi, CXPropertyType type) {
+    const Value &values = multi["values"], &labels = multi["labels"], &identifiers = multi["identifiers"];
+    if (multi.count() != 3 || !labels.isArray() || !identifiers.isArray()) return false;
+    const Array &all = *values.arrayIf(), &ids = *identifiers.arrayIf(), &names = *labels.arrayIf();
+    if (ids.count() != all.count() || names.count() != all.count()) return false;
+    for (size_t i = 0; i < all.count(); ++i) {
+        if (!isOfType(all[i], type) || !isText(ids[i]) || !names[i].isString()) return false;
+        for (size_t j = 0; j < i; ++j)
+            if (ids[j].string() == ids[i].string()) return false;
+    }
+    return true;
+}
+
 // The multi-value with the entries of the right kind; all entries when the kind is not known.
 Value cleanMultiValue(const Value& value, std::optional<CXPropertyType> type, bool generateIdentifiers) {
     CXMutableMultiValue multi(*CXMultiValue::fromValue(value));
@@ -143,6 +161,28 @@ Value cxCarriableValue(const Value& value) {
     return value;
 }
 
+namespace {
+
+bool isCarriable(const Value& value) {
+    if (const std::string* text = value.stringIf()) return !xmlTextFault(*text);
+    if (const Array* items = value.arrayIf()) return std::all_of(items->begin(), items->end(), isCarriable);
+    if (const Dictionary* entries = value.dictionaryIf())
+        return std::all_of(entries->begin(), entries->end(),
+                           [](const auto& entry) { return !xmlTextFault(entry.first) && isCarriable(entry.second); });
+    return true;
+}
+
+// Nearly every multi-value is as it should be; nothing is taken apart then.
+Value sanitizedMultiValue(const Value& value, std::optional<CXPropertyType> type, bool generateIdentifiers) {
+    constexpr size_t kMostEntries = 100; // of which identifiers are compared with one another
+    if (type && !generateIdentifiers && value.dictionary()["values"].array().count() <= kMostEntries &&
+        isCleanMultiValue(*value.dictionaryIf(), *type) && isCarriable(value))
+        return value.deepMutableCopy();
+    return cleanMultiValue(cxCarriableValue(value), type, generateIdentifiers);
+}
+
+} // namespace
+
 Dictionary cxSanitizedProperties(std::string_view table, const Dictionary& dictionary, bool skipUnknownProperties,
                                  bool generateMultiValueIDs) {
     Dictionary result;
@@ -154,8 +194,8 @@ Dictionary cxSanitizedProperties(std::string_view table, const Dictionary& dicti
         bool fits = !type || (isMulti(*type) ? isMultiValue : isOfType(value, *type));
         if (skipUnknownProperties && !fits) continue;
         if (isMultiValue && (!type || isMulti(*type)))
-            result.set(name, cleanMultiValue(cxCarriableValue(value), skipUnknownProperties ? type : std::nullopt,
-                                             generateMultiValueIDs));
+            result.set(name,
+                       sanitizedMultiValue(value, skipUnknownProperties ? type : std::nullopt, generateMultiValueIDs));
         else
             result.set(name, cxCarriableValue(value));
     }

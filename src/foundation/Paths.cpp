@@ -2,6 +2,7 @@
 
 #include "foundation/SystemError.h"
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <cstdint>
@@ -213,16 +214,40 @@ std::string readFile(const std::string& path, size_t maxBytes) {
     return text;
 }
 
+namespace {
+
+// Random bytes of a thread's own, drawn many at a time; a process that was forked off draws its own.
+void drawRandom(std::array<uint8_t, 16>& out) {
+    struct Pool {
+        std::array<uint8_t, 256> bytes; // as many as the kernel gives at once whatever happens
+        size_t used = sizeof bytes;
+        pid_t process = 0;
+    };
+    thread_local Pool pool;
+    if (pool.used + out.size() > pool.bytes.size() || pool.process != ::getpid()) {
+        if (::getrandom(pool.bytes.data(), pool.bytes.size(), 0) != static_cast<ssize_t>(pool.bytes.size()))
+            throw cxSystemException("draw random numbers from", "getrandom", errno);
+        pool.used = 0;
+        pool.process = ::getpid();
+    }
+    std::copy_n(pool.bytes.begin() + static_cast<std::ptrdiff_t>(pool.used), out.size(), out.begin());
+    pool.used += out.size();
+}
+
+} // namespace
+
 std::string makeUUID() {
+    constexpr std::string_view kDigits = "0123456789ABCDEF";
     std::array<uint8_t, 16> b{};
-    if (::getrandom(b.data(), b.size(), 0) != static_cast<ssize_t>(b.size()))
-        throw cxSystemException("draw random numbers from", "getrandom", errno);
+    drawRandom(b);
     b[6] = static_cast<uint8_t>((b[6] & 0x0f) | 0x40);
     b[8] = static_cast<uint8_t>((b[8] & 0x3f) | 0x80);
     std::string out;
+    out.reserve(36);
     for (size_t i = 0; i < b.size(); ++i) {
         if (i == 4 || i == 6 || i == 8 || i == 10) out += '-';
-        out += fmt::format("{:02X}", b[i]);
+        out += kDigits[b[i] >> 4];
+        out += kDigits[b[i] & 15];
     }
     return out;
 }

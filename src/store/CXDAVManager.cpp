@@ -183,10 +183,13 @@ bool CXDAVManager::createDirectoryAtAURL(const Url& url) {
 
 std::optional<FileListing> CXDAVManager::infoForFilesInContainer(const Url& url) {
     auto listing = StoreListing(_impl->session, _impl->versions, _impl->listings).list(url);
-    if (listing)
-        for (const auto& [path, file] : *listing)
-            if (file.seen && file.displayName.ends_with("CXGroup"))
-                _impl->files.copies().foundUnchanged(url.cxURLByAppendingComponent(file.displayName).absoluteString());
+    if (!listing) return listing;
+    for (const auto& [path, file] : *listing) {
+        if (!file.displayName.ends_with("CXGroup")) continue;
+        const Url group = url.cxURLByAppendingComponent(file.displayName);
+        if (file.isCollection) _impl->files.foundCollection(group);
+        if (file.seen) _impl->files.copies().foundUnchanged(group.absoluteString());
+    }
     return listing;
 }
 

@@ -24,8 +24,8 @@ struct FileInfo {
     uint64_t size = 0;
     EntityTag etag; // empty when the store gives none
     bool isCollection = false;
-    bool seen = false; // remote: this very version was read or written by this client
-    std::optional<Date> stored; // remote: the store's own date of the file, read or not
+    bool seen = false;               // remote: this very version was read or written by this client
+    std::optional<Date> stored = {}; // remote: the store's own date of the file, read or not
 };
 // Keyed by path: the decoded path of the entry's URL. Enumerates in byte order of the paths.
 using FileListing = std::map<std::string, FileInfo>;

@@ -234,8 +234,13 @@ void StoreFiles::expectReads(const std::vector<Url>& names, bool securely) {
     std::vector<Url> urls;
     urls.reserve(names.size());
     for (const Url& name : names)
-        if (const auto url = _session.endpoint(name, securely)) urls.push_back(*url);
+        if (const auto url = _session.endpoint(name, securely))
+            urls.push_back(mayBeBoth(name) && knownCollection(*url) ? stateURL(*url) : *url);
     _ahead.expect(urls);
+}
+
+void StoreFiles::foundCollection(const Url& name) {
+    if (const auto url = _session.endpoint(name)) remember(*url);
 }
 
 std::optional<Date> StoreFiles::modificationDate(const Url& name) {

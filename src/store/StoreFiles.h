@@ -30,6 +30,8 @@ public:
     Reading read(const Url& name, bool securely);
     // These are going to be read, in this order (see ReadAhead).
     void expectReads(const std::vector<Url>& names, bool securely);
+    // A listing has shown that the group is a collection: its state is looked for inside first.
+    void foundCollection(const Url& name);
     // The groups' dictionaries whose version is the one that this client knows; consulted by `read` during a snapshot.
     GroupCopies& copies() { return _copies; }
     // `repair` is called when a folder on the way to the file is missing; true: worth another try.

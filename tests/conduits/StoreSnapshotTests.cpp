@@ -29,6 +29,12 @@ struct MemoryFiles : CXFileManager {
         const auto found = listings.find(url.absoluteString());
         return found == listings.end() ? std::nullopt : std::optional(found->second);
     }
+    void expectReads(const std::vector<Url>& urls, bool) override {
+        std::string names;
+        for (const Url& url : urls) names += (names.empty() ? "" : " ") + url.cxLastComponent();
+        expected.push_back(names);
+    }
+    Texts expected; // what was to be fetched ahead, call by call
     std::map<std::string, Dictionary> files;
     std::map<std::string, int> codes; // failures
     std::map<std::string, FileListing> listings;
@@ -142,6 +148,18 @@ TEST_F(StoreSnapshot, AGroupFileWithoutADateYieldsAnEmptyStateAndIsNotRead) {
     bobsListing()["/bob/Contacts/G:CXGroup"].modificationdate.reset();
     EXPECT_EQ((*fetch())["G:CXGroup"], Value(Dictionary()));
     EXPECT_EQ(conduit.files.asked, (Texts{kBob + "/info", "list " + kBob}));
+}
+
+TEST_F(StoreSnapshot, TheGroupsThatHaveToBeReadAreFetchedAheadTogether) {
+    publish(kBob, {"a:CXPerson"}, {{"G:CXGroup", {}}, {"H:CXGroup", {}}, {"I:CXGroup", {}}, {"J:CXGroup", {}}});
+    bobsListing()["/bob/Contacts/H:CXGroup"].seen = true;
+    bobsListing()["/bob/Contacts/I:CXGroup"].size = 5u << 20; // alone, when it is its turn
+    ASSERT_TRUE(fetch());
+    EXPECT_EQ(conduit.files.expected, (Texts{"G:CXGroup J:CXGroup", ""}));
+    conduit.files.expected.clear();
+    conduit.files.codes[kBob + "/G%3ACXGroup"] = 500;
+    EXPECT_FALSE(fetch());
+    EXPECT_EQ(conduit.files.expected, (Texts{"G:CXGroup J:CXGroup", ""})) << "nothing is fetched for nobody";
 }
 
 TEST_F(StoreSnapshot, AContactFileWithoutADateDoesNotAppear) {

@@ -117,6 +117,32 @@ TEST(Record, ASaveThatChangesNothingKeepsTheModificationDateAndWritesNoJournal) 
     EXPECT_EQ(ada->valueForProperty(kCXModificationDateProperty).date(), Date(1700000000));
 }
 
+TEST(Record, AMultiValueIsTakenAsItIsExactlyWhenNothingIsWrongWithIt) {
+    const auto multi = [](Array identifiers, Array labels, Array values) {
+        return Value(Dictionary{{"identifiers", identifiers}, {"labels", labels}, {"values", values}});
+    };
+    const auto taken = [](const char* property, const Value& value) {
+        return cxSanitizedProperties("CXPerson", Dictionary{{property, value}}, true, false)[property];
+    };
+    const Value clean = multi({"1", "2"}, {"home", ""}, {"+1", "+2"});
+    EXPECT_EQ(taken("Phone", clean), clean);
+    const Value kept = taken("Phone", clean);
+    Array(clean.dictionary()["values"].array()).append("+3");
+    EXPECT_EQ(kept, multi({"1", "2"}, {"home", ""}, {"+1", "+2"})) << "shares nothing with what it was made of";
+
+    EXPECT_EQ(taken("Phone", multi({"1", "2"}, {"a", "b"}, {"+1", 2})), multi({"1"}, {"a"}, {"+1"})) << "wrong type";
+    EXPECT_EQ(taken("Phone", multi({"1"}, {"a"}, {std::string("+\x01") + "1"})), multi({"1"}, {"a"}, {"+1"}));
+    EXPECT_EQ(taken("Phone", multi({"1"}, {std::string("a\x01")}, {"+1"})), multi({"1"}, {"a"}, {"+1"}));
+    EXPECT_EQ(taken("Phone", multi({"1"}, {Value(3)}, {"+1"})), multi({"1"}, {""}, {"+1"})) << "no label";
+    EXPECT_EQ(taken("Phone", multi({"1"}, {}, {"+1"})), multi({"1"}, {""}, {"+1"}));
+    const Value twice = taken("Phone", multi({"1", "1"}, {"a", "b"}, {"+1", "+2"})).dictionary()["identifiers"];
+    EXPECT_EQ(twice.array().count(), 2u);
+    EXPECT_NE(twice.array()[0], twice.array()[1]);
+    Dictionary more = multi({"1"}, {"a"}, {"+1"}).dictionary();
+    more.set("else", 1);
+    EXPECT_EQ(taken("Phone", more), multi({"1"}, {"a"}, {"+1"})) << "and nothing besides";
+}
+
 TEST(Record, ResettingReplacesEverythingAndDropsWhatItDoesNotKnow) {
     TestDatabase d;
     CXPersonRef ada = d.addPerson("Ada");
