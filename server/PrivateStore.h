@@ -81,7 +81,8 @@ public:
     PrivateStoreStatus status() const;
 
     // Makes the user and the empty tree, or gives an existing user a new password. A running store takes it in at once;
-    // one without access lists is restarted when the set of users changes. Names: letters, digits and . _ - @ +, at most 64, the first a letter, digit or '_'.
+    // one without access lists is restarted when the set of users changes. Names: letters, digits and . _ - @ +, at
+    // most 64, the first a letter, digit or '_'.
     void addUser(const std::string& user, const std::string& password);
     // Takes the account away; the user's files stay. False when there is no such user.
     bool removeUser(const std::string& user);
