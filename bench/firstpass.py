@@ -232,7 +232,7 @@ class Subscription:
         return 1 if self.quick else ROUNDS.get(count, 1)
 
     def invite(self, publisher, count):
-        """Accounts that may read the tree. A new account restarts the store, so all are made before the measuring."""
+        """Accounts that may read the tree, made before anything is measured."""
         self.names = [f"s{self.made + i}" for i in range(count)]
         self.made += count
         for name in self.names:
