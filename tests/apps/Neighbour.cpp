@@ -54,6 +54,18 @@ Ran Neighbour::rolvane(std::vector<std::string> arguments, const std::string& in
     return {status, child.output(), child.errors()};
 }
 
+std::unique_ptr<ChildProcess> Neighbour::startRolvane(std::vector<std::string> arguments) {
+    arguments.insert(arguments.begin(), UserWorld::rolvaneProgram());
+    return std::make_unique<ChildProcess>(
+        ChildProcess::Options{.arguments = std::move(arguments), .environment = environment()});
+}
+
+std::unique_ptr<ChildProcess> Neighbour::startManager(std::vector<std::string> arguments) {
+    arguments.insert(arguments.begin(), UserWorld::managerProgram());
+    return std::make_unique<ChildProcess>(
+        ChildProcess::Options{.arguments = std::move(arguments), .environment = environment()});
+}
+
 std::string Neighbour::done(std::vector<std::string> arguments) {
     const Ran ran = rolvane(std::move(arguments));
     EXPECT_EQ(ran.status, kDone) << ran;

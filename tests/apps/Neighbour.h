@@ -18,6 +18,9 @@ public:
     std::string done(std::vector<std::string> arguments); // it has to end with 0
     nlohmann::json json(std::vector<std::string> arguments, int status = kDone);
     std::optional<pid_t> daemon();
+    std::unique_ptr<ChildProcess> startRolvane(std::vector<std::string> arguments);
+    std::unique_ptr<ChildProcess> startManager(std::vector<std::string> arguments = {});
+    std::string databasePath() const { return _home / "data/rolvane/contacts.db"; }
 
     const std::string user;
 

@@ -1,0 +1,44 @@
+#pragma once
+
+#include "Neighbour.h"
+
+#include "contacts/CXRolvane.h"
+
+#include <map>
+#include <memory>
+#include <random>
+#include <string>
+#include <vector>
+
+namespace rolvane::test {
+
+// Alice publishes people and groups, bob may write there and is subscribed. Their databases are edited as a contact
+// application does it, by another process than the daemons.
+class TwoPeople : public testing::Test {
+protected:
+    static constexpr size_t kGroups = 5;
+    explicit TwoPeople(size_t people);
+    ~TwoPeople() override;
+
+    CXPersonRef personOf(CXRolvane& database, size_t i) const;
+    CXGroupRef groupOf(CXRolvane& database, size_t i) const;
+    // One edit, mostly of a name, else of a membership; the value is remembered with who has written it.
+    void edit(CXRolvane& database, const std::string& who, int number);
+    // What a database holds of alice's, by record; and what the store holds. Lists that name somebody twice say so.
+    std::map<std::string, std::string> view(CXRolvane& database) const;
+    std::map<std::string, std::string> storeView();
+    void expectEqual(const std::map<std::string, std::string>& expected,
+                     const std::map<std::string, std::string>& found, const std::string& what) const;
+    void expectEverySurvivingNameWasWritten(CXRolvane& database) const;
+
+    CommandWorld world;
+    std::unique_ptr<Neighbour> bobsProgram;
+    NotificationCenter aliceCenter, bobCenter;
+    std::unique_ptr<CXRolvane> alice, bob;
+    std::mt19937 random{20260612};
+    std::vector<UniqueId> people, groups;
+    std::map<std::string, std::set<std::string>> written; // by contact
+    std::string location;
+};
+
+} // namespace rolvane::test
