@@ -1,6 +1,7 @@
 #include "engine/ApplyLoop.h"
 
 #include "contacts/CXRolvane.h"
+#include "contacts/Identifier.h"
 #include "engine/ChangeQueue.h"
 #include "engine/GoneThings.h"
 #include "engine/Mingler.h"
@@ -167,9 +168,26 @@ void ApplyLoop::applyInOrder() {
     }
 }
 
+// A version of a contact that has come while our own one could not be written: taken in now, it would stand here while
+// ours, which is written with the next pass, stands on the store. It is left unread, and offered again until then.
+bool ApplyLoop::meetsOwnWaitingWrite(const CXDChangeRecord& record) {
+    if (record.type() != CXDUpdateRecord || record.initialSource() == CXDSyncSourceCX || !record.person()) return false;
+    if (!_waitingWrites) {
+        _waitingWrites.emplace();
+        for (const CXDChangeRecordPtr& waiting : _outOfOrder->pending())
+            if (waiting->type() == CXDUpdateRecord && waiting->initialSource() == CXDSyncSourceCX && waiting->person())
+                _waitingWrites->emplace(waiting->user().value_or(UserName()), cxNormalizedUID(*waiting->person()));
+    }
+    return !_waitingWrites->empty() &&
+           _waitingWrites->contains({record.user().value_or(UserName()), cxNormalizedUID(*record.person())});
+}
+
 void ApplyLoop::applyInOrder(const CXDChangeRecordPtr& record) {
     int32_t left = record->appliesToSources();
-    if (!_parts.terminating) {
+    if (!_parts.terminating && meetsOwnWaitingWrite(*record)) {
+        CXDLog("%@ waits until our own version is written", record);
+        left = 0;
+    } else if (!_parts.terminating) {
         if ((left & CXDSyncSourceCX) && applyTo(*_parts.conduits.cx, CXDSyncSourceCX, record)) left &= ~CXDSyncSourceCX;
         if (left & CXDSyncSourceVaultra) {
             if (applyTo(*_parts.conduits.vaultra, CXDSyncSourceVaultra, record)) left &= ~CXDSyncSourceVaultra;

@@ -6,7 +6,10 @@
 #include <exception>
 #include <functional>
 #include <memory>
+#include <optional>
+#include <set>
 #include <unordered_set>
+#include <utility>
 
 namespace rolvane {
 
@@ -39,6 +42,7 @@ private:
     void applyOutOfOrder();
     void applyInOrder();
     void applyInOrder(const CXDChangeRecordPtr& record);
+    bool meetsOwnWaitingWrite(const CXDChangeRecord& record);
     bool applyTo(CXDConduit& conduit, int32_t source, const CXDChangeRecordPtr& record);
     void cancelLike(const CXDChangeRecordPtr& record);
     void cleanUp();
@@ -59,6 +63,7 @@ private:
     std::unique_ptr<OutOfOrderWork> _outOfOrder;
     bool _denied = false; // handed to every in-order apply; never cleared in a pass
     std::unordered_set<UserName> _cancelledUsers;
+    std::optional<std::set<std::pair<UserName, UniqueId>>> _waitingWrites; // of contacts, that the workers left
     size_t _totalCount = 0, _processedCount = 0;
 };
 

@@ -35,6 +35,7 @@ public:
 
     size_t processedCount() const { return _processedCount; } // after wait
     size_t workers() const { return _workers.size(); }
+    const CXDChangeRecords& pending() const { return _pending; } // once nobody works any more
     CXDChangeRecords takePending();   // after finish
     CXDChangeRecords takeUntouched(); // after finish: what nobody has taken
 

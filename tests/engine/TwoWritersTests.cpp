@@ -38,6 +38,29 @@ protected:
     std::map<std::string, std::set<std::string>> written; // by contact: every name that somebody gave it
 };
 
+// Both edit one contact, and one of the two writes cannot be made in the pass that reads the other's.
+TEST_F(TwoWriters, AnEditThatWaitsAndAnotherOneThatArrivesMeanwhileEndWithOneValueEverywhere) {
+    bob.pass();
+    bob.copyOf(people[0])->setValue(Value("Bob's"), kCXFirstNameProperty);
+    bob.application->save();
+    writeElsewhere(people[0], "Alice's");
+    std::atomic<bool> fails = true;
+    bob.wire->intercept([&](const HttpRequest& request) {
+        const bool writes = request.method == "PUT" && request.url.encodedPath().find("/People/") != std::string::npos;
+        return fails && writes ? std::optional(answerOf(503)) : std::nullopt;
+    });
+    for (int pass = 0; pass < 2; ++pass) {
+        bob.pass();
+        EXPECT_EQ(bob.engine->getPendingChanges().size(), 1u) << log.text();
+        EXPECT_EQ(firstName(bob.copyOf(people[0])), Value("Bob's")) << "his edit is not taken from him";
+    }
+    fails = false;
+    for (Participant* each : {&bob, &alice, &bob, &alice}) each->pass();
+    EXPECT_EQ(copies(), alice.view()) << log.text();
+    EXPECT_EQ(contentOf(fileOf(people[0]))[kCXFirstNameProperty], firstName(people[0]));
+    for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
+}
+
 TEST_F(TwoWriters, AfterFiveHundredEditsEachBothDatabasesAndTheStoreAreEqual) {
     constexpr int kEdits = 500;
     std::mt19937 random(20260611);
