@@ -5,7 +5,7 @@
 
 namespace rolvane::cli {
 
-PassWatch::PassWatch(Context& context) : _context(context) {
+PassWatch::PassWatch(Context& context, bool progress) : _context(context) {
     using Kind = Event::Kind;
     DistributedNotifications& bus = context.bus();
     _observations.push_back(bus.observe(
@@ -14,12 +14,13 @@ PassWatch::PassWatch(Context& context) : _context(context) {
             heard({Kind::started, {}, 0});
         },
         false));
-    _observations.push_back(bus.observe(
-        "CXDSyncProgressNotification",
-        [this](const Notification& n) {
-            heard({Kind::progress, n.userInfo["remoteLocation"].string(), n.userInfo["progress"].real()});
-        },
-        false));
+    if (progress)
+        _observations.push_back(bus.observe(
+            "CXDSyncProgressNotification",
+            [this](const Notification& n) {
+                heard({Kind::progress, n.userInfo["remoteLocation"].string(), n.userInfo["progress"].real()});
+            },
+            false));
     _observations.push_back(bus.observe(
         "CXDStoppedSyncingNotification",
         [this](const Notification&) {

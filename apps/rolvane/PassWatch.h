@@ -12,7 +12,8 @@ namespace rolvane::cli {
 // Hears what the daemon says of its passes, from construction on.
 class PassWatch {
 public:
-    explicit PassWatch(Context& context);
+    // Without progress, which is a notification a contact, the bus and this process have nothing to do for it.
+    explicit PassWatch(Context& context, bool progress = true);
 
     // What came: one of the three notifications, with location and fraction for progress.
     struct Event {

@@ -84,7 +84,7 @@ void makePass(Context& context, double seconds) {
     if (!daemon.running()) {
         daemon.runOnce(seconds);
     } else {
-        PassWatch watch(context);
+        PassWatch watch(context, !context.quiet);
         if (!context.bus().post({"SimulateVaultraNotification", std::nullopt, {}}))
             throw CommandError(kUnreachable, "There is no session bus, so the daemon cannot be asked. `rolvane daemon "
                                              "restart` makes a pass without one.");

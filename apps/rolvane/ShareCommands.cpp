@@ -165,7 +165,7 @@ void changeShares(Context& context, const ShareOptions& options, bool grant) {
     if (takesBack && !options.noDaemon && !options.noWait && writers == std::vector{user})
         takeInWhatWasWritten(context, options.timeout);
 
-    PassWatch watch(context);
+    PassWatch watch(context, !context.quiet);
     const bool hadWriters = !writers.empty();
     grant ? shares.grant(user, options.write) : shares.deny(user);
     // What writers send is taken only by a daemon that knew of one when it started, and without a bus none hears of the

@@ -31,7 +31,7 @@ void publish(Context& context, const PublishOptions& options) {
     if (!CXDAVManager::canReachOstrelError(error) && error.code == kCXDAVErrorAuthentication)
         throw CommandError(kRefused, error.reason + " Nothing was published.");
 
-    PassWatch watch(context);
+    PassWatch watch(context, !context.quiet);
     const CXGroupRef group = options.group.empty() ? nullptr : findGroup(database, options.group);
     const bool changed = group ? publication.publishGroup(group, base) : publication.publishEverything(base);
     database.save();

@@ -138,7 +138,7 @@ void subscribe(Context& context, const SubscribeOptions& options) {
     requirePublication(location);
 
     const bool served = Publication(database).anything() || !subscriptionsToPeople(database).empty();
-    PassWatch watch(context);
+    PassWatch watch(context, !context.quiet);
     database.addRecord(CXSubscription::create(location));
     database.save();
     const int64_t position = database.journalPosition();

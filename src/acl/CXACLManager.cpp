@@ -18,8 +18,10 @@ using Digest = std::array<unsigned char, EVP_MAX_MD_SIZE>;
 
 // The one place that asks OpenSSL for an MD5 digest; here it spreads names, it protects nothing.
 Digest md5(std::string_view bytes) {
+    // Found once, for the process's life: OpenSSL looks an algorithm up anew at each use of its plain name.
+    static const EVP_MD* const fetched = EVP_MD_fetch(nullptr, "MD5", nullptr);
     Digest digest{};
-    if (EVP_Digest(bytes.data(), bytes.size(), digest.data(), nullptr, EVP_md5(), nullptr) != 1)
+    if (!fetched || EVP_Digest(bytes.data(), bytes.size(), digest.data(), nullptr, fetched, nullptr) != 1)
         throw CXException("CXDigestException",
                           "MD5 is not available from the system's OpenSSL; a bucket cannot be named");
     return digest;

@@ -17,6 +17,7 @@ using namespace std::chrono_literals;
 using Steady = std::chrono::steady_clock;
 
 constexpr auto kConnectLimit = 500ms;
+constexpr auto kPumpInterval = 20ms;
 constexpr auto kSlowBusLimit = 100ms;
 constexpr auto kFarewellLimit = 500ms;
 // After a failed attempt so many times its duration pass before the next one: looking for a bus that is not there costs
@@ -46,9 +47,18 @@ bool BusPoster::connect() {
 }
 
 // Whether there is a connection whose other end is still there; notices the end of one that went away.
-bool BusPoster::ready() {
+bool BusPoster::pump() {
     if (_bus && !pumpBus(_bus.get())) _bus.reset();
     return _bus != nullptr;
+}
+
+// The same for somebody who is about to send, which notices, too: hardly anything comes in, so it is not looked for at
+// each of thousands of notifications a second.
+bool BusPoster::ready() {
+    const auto now = Steady::now();
+    if (_bus && now < _nextPump) return true;
+    _nextPump = now + kPumpInterval;
+    return pump();
 }
 
 int BusPoster::send(const Notification& notification) {
@@ -93,14 +103,14 @@ bool BusPoster::post(const Notification& notification) {
 
 bool BusPoster::connected() {
     std::lock_guard guard(_mutex);
-    return ready();
+    return pump();
 }
 
 bool BusPoster::writeQueued() {
     std::lock_guard guard(_mutex);
     eventfd_t ignored;
     ::eventfd_read(_queuedDescriptor, &ignored);
-    if (!ready()) return true;
+    if (!pump()) return true;
     uint64_t queued = 0;
     bool empty = sd_bus_get_n_queued_write(_bus.get(), &queued) < 0 || queued == 0;
     if (empty) _stalled = false;

@@ -27,6 +27,7 @@ public:
 
 private:
     bool connect();
+    bool pump();
     bool ready();
     int send(const Notification& notification);
     void settle();
@@ -35,7 +36,7 @@ private:
     int _queuedDescriptor;
     std::mutex _mutex; // of everything below
     Bus _bus;
-    std::chrono::steady_clock::time_point _nextAttempt{};
+    std::chrono::steady_clock::time_point _nextAttempt{}, _nextPump{};
     bool _stalled = false; // the bus takes nothing; nobody waits for it until it does again
 };
 

@@ -38,10 +38,16 @@ bool isDigest(const EntityTag& tag) {
     return text.size() == kDigestLength && text.back() == '=' && text.find('-') == std::string_view::npos;
 }
 
+// Found once: OpenSSL looks an algorithm up anew at each use of its plain name.
+const EVP_MD* sha1() {
+    static const EVP_MD* const fetched = EVP_MD_fetch(nullptr, "SHA1", nullptr); // for the process's life
+    return fetched ? fetched : EVP_sha1();
+}
+
 std::string digestOf(std::string_view content) {
     unsigned char digest[EVP_MAX_MD_SIZE];
     unsigned int length = 0;
-    if (EVP_Digest(content.data(), content.size(), digest, &length, EVP_sha1(), nullptr) != 1) return {};
+    if (EVP_Digest(content.data(), content.size(), digest, &length, sha1(), nullptr) != 1) return {};
     std::string text;
     appendBase64(digest, length, text);
     return text;
