@@ -105,7 +105,7 @@ const ChangeCapture::CapturedPerson* ChangeCapture::capturedBefore(const UniqueI
 
 // The same identifier, whose text the records share where the person has been captured.
 UniqueId ChangeCapture::sharedText(const UniqueId& uid) const {
-    const CapturedPerson* before = capturedBefore(uid);
+    const CapturedPerson* before = _people.empty() ? nullptr : capturedBefore(uid);
     return before ? before->uniqueId : uid;
 }
 

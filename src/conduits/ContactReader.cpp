@@ -20,11 +20,10 @@ Dictionary choicesUnder(const std::map<UniqueId, CXDistributionChoices>& all, co
     return found == all.end() ? Dictionary() : asDictionary(found->second);
 }
 
-Array normalized(const std::vector<UniqueId>& identifiers, const ContactReader::TextSharing& share) {
+Array asArray(const std::vector<UniqueId>& identifiers, const ContactReader::TextSharing& share) {
     std::vector<Value> all;
     all.reserve(identifiers.size());
-    for (const UniqueId& identifier : identifiers)
-        all.emplace_back(cxNormalizedUID(share ? share(identifier) : identifier));
+    for (const UniqueId& identifier : identifiers) all.emplace_back(share ? share(identifier) : identifier);
     return Array(std::move(all));
 }
 
@@ -137,8 +136,8 @@ std::optional<RemoteLocation> ContactReader::locationOfGroup(const CXGroup& grou
 
 Dictionary ContactReader::groupState(const CXGroup& group, bool withDistributionLists, const TextSharing& share) const {
     Dictionary state;
-    state.set(kMemberUIDState, normalized(group.memberIdentifiers(), share));
-    state.set(kSubgroupUIDState, normalized(group.subgroupIdentifiers(), {}));
+    state.set(kMemberUIDState, asArray(group.memberIdentifiers(), share));
+    state.set(kSubgroupUIDState, asArray(group.subgroupIdentifiers(), {}));
     if (const std::string name = group.name(); !name.empty()) state.set(kCXGroupNameProperty, name);
     addPrincipals(state, group, kCXReadWriteSharingACLProperty);
     addPrincipals(state, group, kCXReadSharingACLProperty);

@@ -16,9 +16,11 @@ bool isAllTable(std::string_view table) {
     return table == kCXAllGroupUID || table == kCXAllSubscribedGroupTable;
 }
 
-UniqueId join(std::string_view uuid, bool hasUUID, std::string table) {
-    if (!hasUUID) return UniqueId(std::move(table));
-    return UniqueId(std::string(uuid) + ":" + table);
+UniqueId join(std::string_view uuid, bool hasUUID, std::string_view table) {
+    if (!hasUUID) return UniqueId(std::string(table));
+    std::string text;
+    text.reserve(uuid.size() + 1 + table.size());
+    return UniqueId(std::move(text.append(uuid).append(1, ':').append(table)));
 }
 
 } // namespace
@@ -44,12 +46,12 @@ UniqueId cxUIDWithTableName(const UniqueId& uid, std::string_view table) {
         std::string all(kAllPrefix.substr(0, 3));
         return join(cxUUIDPart(uid), hasUUID, all.append(table));
     }
-    return join(cxUUIDPart(uid), hasUUID, std::string(table));
+    return join(cxUUIDPart(uid), hasUUID, table);
 }
 
 UniqueId cxNormalizedUID(const UniqueId& uid) {
     std::string_view table = cxTableName(uid);
-    if (table == kCXSubscribedPersonTable) return cxUIDWithTableName(uid, kCXPersonTable);
+    if (table == kCXSubscribedPersonTable) return join(cxUUIDPart(uid), true, kCXPersonTable);
     if (table == kCXSubscribedGroupTable || table == kCXAllSubscribedGroupTable)
         return cxUIDWithTableName(uid, kCXGroupTable);
     return uid;

@@ -12,7 +12,7 @@ namespace rolvane {
 
 namespace {
 
-constexpr int kFormat = 2;
+constexpr int kFormat = 3;
 constexpr int64_t kApplicationId = 0x52564c43; // "RVLC"
 
 constexpr const char* kTables = R"(
@@ -31,6 +31,7 @@ CREATE TABLE records(
   writer TEXT NOT NULL DEFAULT '');
 CREATE INDEX records_modified ON records(kind, modified);
 CREATE INDEX records_location ON records(kind, location, id, uid);
+CREATE INDEX records_names ON records(id, uid, kind);
 CREATE TABLE listed(
   group_id INTEGER NOT NULL REFERENCES records(id) ON DELETE CASCADE,
   position INTEGER NOT NULL,
@@ -118,6 +119,7 @@ void RecordStore::makeOrCheckFormat() {
                                                     " is no contact database. Name another file or move it away.");
     int64_t format = _database.integer("PRAGMA user_version");
     if (format == 1) format = addWriters();
+    if (format == 2) format = addNames();
     if (format > kFormat)
         throw CXException(kCXDatabaseException, "The contact database " + _database.path() +
                                                     " was written by a newer version (format " +
@@ -132,6 +134,15 @@ int64_t RecordStore::addWriters() {
         _database.execute(
             "ALTER TABLE records ADD COLUMN writer TEXT NOT NULL DEFAULT ''; DROP INDEX records_location; "
             "CREATE INDEX records_location ON records(kind, location, id, uid); PRAGMA user_version=2;");
+    transaction.commit();
+    return _database.integer("PRAGMA user_version");
+}
+
+// Format 2 could name a group's members only by a look at each member's row.
+int64_t RecordStore::addNames() {
+    SqliteTransaction transaction(_database);
+    if (_database.integer("PRAGMA user_version") == 2) // nobody else did it meanwhile
+        _database.execute("CREATE INDEX IF NOT EXISTS records_names ON records(id, uid, kind); PRAGMA user_version=3;");
     transaction.commit();
     return _database.integer("PRAGMA user_version");
 }
@@ -219,8 +230,9 @@ std::vector<std::pair<int64_t, UniqueId>> RecordStore::recordsOf(RecordKind kind
 }
 
 std::vector<std::pair<UniqueId, RecordKind>> RecordStore::listed(const UniqueId& group) {
-    auto s = _database.statement("SELECT r.uid, r.kind FROM listed l JOIN records r ON r.id=l.member_id "
-                                 "WHERE l.group_id=(SELECT id FROM records WHERE uid=?) ORDER BY l.position");
+    auto s = _database.statement(
+        "SELECT r.uid, r.kind FROM listed l CROSS JOIN records r INDEXED BY records_names "
+        "ON r.id=l.member_id WHERE l.group_id=(SELECT id FROM records WHERE uid=?) ORDER BY l.position");
     s.bind(1, group.str());
     std::vector<std::pair<UniqueId, RecordKind>> all;
     while (s.step()) all.emplace_back(UniqueId(s.text(0)), static_cast<RecordKind>(s.integer(1)));
@@ -234,8 +246,9 @@ bool RecordStore::isListed(const UniqueId& group, const UniqueId& member) {
 }
 
 int64_t RecordStore::countMembers(const UniqueId& group) {
-    auto s = _database.statement("SELECT count(*) FROM listed l JOIN records r ON r.id=l.member_id "
-                                 "WHERE l.group_id=(SELECT id FROM records WHERE uid=?) AND r.kind IN (1,2)");
+    auto s = _database.statement(
+        "SELECT count(*) FROM listed l CROSS JOIN records r INDEXED BY records_names "
+        "ON r.id=l.member_id WHERE l.group_id=(SELECT id FROM records WHERE uid=?) AND r.kind IN (1,2)");
     s.bind(1, group.str()).step();
     return s.integer(0);
 }

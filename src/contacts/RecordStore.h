@@ -92,6 +92,7 @@ public:
 private:
     void makeOrCheckFormat();
     int64_t addWriters(); // the format then
+    int64_t addNames();
     void fillNewDatabase();
     std::vector<CXRow> rowsWithParents(Sqlite::Statement& s, int positionColumn, int64_t& position);
     void addParents(std::vector<CXRow>& rows, const std::vector<int64_t>& ids);

@@ -28,11 +28,11 @@ std::string reasonOf(const std::function<void()>& work) {
 TEST(DatabaseFault, AFileOfANewerFormatIsRefusedAndLeftAlone) {
     TestDatabase d;
     d.database.reset();
-    Sqlite(d.path, 0).execute("PRAGMA user_version=3");
+    Sqlite(d.path, 0).execute("PRAGMA user_version=4");
     std::string told = reasonOf([&] { d.open(); });
     EXPECT_TELLS(told, "newer version");
     EXPECT_TELLS(told, d.path);
-    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 3);
+    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 4);
 }
 
 TEST(DatabaseFault, AFileOfTheFormerFormatLearnsWhoWroteWhat) {
@@ -40,14 +40,30 @@ TEST(DatabaseFault, AFileOfTheFormerFormatLearnsWhoWroteWhat) {
     d.addPerson("Ada", "A:CXPerson");
     d->save();
     d.database.reset();
-    Sqlite(d.path, 0).execute("ALTER TABLE records DROP COLUMN writer; PRAGMA user_version=1");
+    Sqlite(d.path, 0).execute(
+        "ALTER TABLE records DROP COLUMN writer; DROP INDEX records_names; PRAGMA user_version=1");
     d.database = d.open("rolvane");
     EXPECT_EQ(d->personRow(UniqueId("A:CXPerson"))->writer, "") << "nobody knows";
     d->recordForUniqueId(UniqueId("A:CXPerson"))->setValue(Value("Adele"), kCXFirstNameProperty);
     d->save();
     EXPECT_EQ(d->personRow(UniqueId("A:CXPerson"))->writer, "rolvane");
     d.database.reset();
-    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 2);
+    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 3);
+}
+
+TEST(DatabaseFault, AFileOfTheFormatBeforeNamesItsGroupsMembers) {
+    TestDatabase d;
+    d.addGroup("Friends", "F:CXGroup")->addMember(d.addPerson("Ada", "A:CXPerson"));
+    d->save();
+    d.database.reset();
+    Sqlite(d.path, 0).execute("DROP INDEX records_names; PRAGMA user_version=2");
+    d.database = d.open("rolvane");
+    const auto friends = std::dynamic_pointer_cast<CXGroup>(d->recordForUniqueId(UniqueId("F:CXGroup")));
+    ASSERT_TRUE(friends);
+    EXPECT_EQ(friends->memberUniqueIds(), std::vector{UniqueId("A:CXPerson")});
+    EXPECT_EQ(friends->memberCount(), 1u);
+    d.database.reset();
+    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 3);
 }
 
 TEST(DatabaseFault, AnotherProgramsFileIsRefusedAndLeftAlone) {
