@@ -7,7 +7,7 @@ namespace rolvane {
 void shareHeaps() {
     mallopt(M_ARENA_MAX, 2);
     // What is freed at the end of a heap is wanted again at once while a pass runs; returnFreeMemory gives it back.
-    mallopt(M_TRIM_THRESHOLD, 64 << 20);
+    mallopt(M_TRIM_THRESHOLD, 8 << 20);
     mallopt(M_TOP_PAD, 1 << 20);
 }
 
