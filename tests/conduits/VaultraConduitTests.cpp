@@ -493,7 +493,7 @@ TEST_F(VaultraConduit, ARecordThatIsCalledLikeTheTreesOwnFilesTouchesNothingAndI
     const auto refused = [&](const CXDChangeRecordPtr& each, const std::string& name) {
         engine.refused.clear();
         log.clear();
-        bool denied = true;
+        denied = true;
         EXPECT_TRUE(conduit->applyChangeRecordIfNeeded(each, &denied)) << name << ": it would wait for ever";
         EXPECT_FALSE(denied) << name << ": the user's other changes are not to go with it";
         EXPECT_EQ(engine.refused, CXDChangeRecords{each}) << name;
