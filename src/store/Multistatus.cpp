@@ -2,7 +2,9 @@
 
 #include "store/XmlSax.h"
 
+#include <algorithm>
 #include <charconv>
+#include <initializer_list>
 
 namespace rolvane {
 
@@ -140,13 +142,17 @@ struct LockAnswerReader : XmlSax {
     bool closed(const std::vector<std::string>& path) override {
         const std::string content = trimmed(gathered);
         gathered.clear();
-        if (path.size() == 4 && path[2] == "activelock" && path[3] == "timeout" && content.starts_with("Second-")) {
+        if (endsWith(path, {"activelock", "timeout"}) && content.starts_with("Second-")) {
             if (const auto n = parsedNumber(std::string_view(content).substr(7)))
                 grant.timeoutSeconds = static_cast<double>(*n);
         }
-        if (path.size() == 5 && path[2] == "activelock" && path[3] == "locktoken" && path[4] == "href")
-            grant.token = LockToken(content);
+        if (endsWith(path, {"activelock", "owner"})) grant.owner = content;
+        if (endsWith(path, {"activelock", "locktoken", "href"})) grant.token = LockToken(content);
         return true;
+    }
+    static bool endsWith(const std::vector<std::string>& path, std::initializer_list<std::string_view> end) {
+        return path.size() > end.size() &&
+               std::equal(end.begin(), end.end(), path.end() - static_cast<std::ptrdiff_t>(end.size()));
     }
 };
 

@@ -46,12 +46,14 @@ private:
     std::unique_ptr<Impl> _impl;
 };
 
-// What a LOCK answer grants (RFC 4918 section 9.10): the active lock's token and timeout.
+// The active lock that a LOCK answer grants (RFC 4918 section 9.10), or that a property lockdiscovery tells of.
 struct LockGrant {
     LockToken token;                      // empty when the body names none
+    std::string owner;                    // the text of what the client said of the owner
     std::optional<double> timeoutSeconds; // nothing: infinite or not said
 };
-// Nothing when the text is not one well-formed document. At most 1 MiB is looked at.
+// Of a LOCK answer, or of a multistatus with the property lockdiscovery of one resource; of several active locks, what
+// the last one says. Nothing when the text is not one well-formed document. At most 1 MiB is looked at.
 std::optional<LockGrant> parseLockAnswer(std::string_view body);
 
 } // namespace rolvane

@@ -6,8 +6,11 @@
 #include "store/CXDAVManagerImpl.h"
 
 #include <algorithm>
+#include <chrono>
 #include <cstdio>
 #include <ctime>
+#include <filesystem>
+#include <map>
 #include <unistd.h>
 
 namespace rolvane {
@@ -46,15 +49,73 @@ std::string startOfProcess(const std::string& pid) {
     }
 }
 
+std::string thisProcess() {
+    return std::to_string(getpid()) + " " + startOfProcess("self");
+}
+
+// Of what thisProcess() gave once.
+bool isAlive(const std::string& process) {
+    const size_t space = process.find(' ');
+    return space != std::string::npos && startOfProcess(process.substr(0, space)) == process.substr(space + 1);
+}
+
+constexpr size_t kMarkLength = 36; // a UUID's
+
+bool isAMark(const std::string& text) {
+    return text.size() == kMarkLength && text.find_first_not_of("0123456789ABCDEFabcdef-") == std::string::npos;
+}
+
+// Marks of runs whose locks have all come to their end by now.
+void removeOldRuns(const std::string& directory) {
+    const auto old = std::filesystem::file_time_type::clock::now() -
+                     std::chrono::duration_cast<std::chrono::seconds>(
+                         std::chrono::duration<double>(2 * CXWebDAVLock::lockTimeout()));
+    std::error_code ignored;
+    for (const auto& run : std::filesystem::directory_iterator(directory, ignored))
+        if (run.last_write_time(ignored) < old && !isAlive(readFile(run.path(), 4096)))
+            std::filesystem::remove(run.path(), ignored);
+}
+
 } // namespace
+
+std::string LockLedger::pathForRun(const std::string& mark) const {
+    return _directory + "-runs/" + mark;
+}
+
+std::string LockLedger::markOfThisRun() const {
+    static std::mutex mutex;
+    static std::map<std::pair<pid_t, std::string>, std::string> marks; // of a process that forked, too
+    if (_directory.empty()) return {};
+    const std::lock_guard guard(mutex);
+    std::string& mark = marks[{getpid(), _directory}];
+    if (!mark.empty() && access(pathForRun(mark).c_str(), R_OK) == 0) return mark;
+    try {
+        CXPathUtils_MakeCompletePath(_directory + "-runs", 0700);
+        removeOldRuns(_directory + "-runs");
+        mark = makeUUID();
+        writeFileDurably(pathForRun(mark), thisProcess());
+    } catch (const CXException& e) {
+        CXDLog("A lock is not marked: %@", e.reason());
+        mark.clear();
+    }
+    return mark;
+}
+
+bool LockLedger::isOfAnEndedRun(const std::string& mark) const {
+    if (_directory.empty() || !isAMark(mark) || access(pathForRun(mark).c_str(), R_OK) != 0) return false;
+    try {
+        return !isAlive(readFile(pathForRun(mark), 4096));
+    } catch (const CXException&) {
+        return false;
+    }
+}
 
 // The file: process id and start, URL and token, a line each.
 void LockLedger::note(const std::string& url, const LockToken& token) {
     if (_directory.empty()) return;
     try {
         CXPathUtils_MakeCompletePath(_directory, 0700);
-        writeFileDurably(pathFor(url), std::to_string(getpid()) + " " + startOfProcess("self") + "\n" + url + "\n" +
-                                           token.str() + "\n");
+        writeFileDurably(pathFor(url), thisProcess() + "\n" + url + "\n" + token.str() + "\n");
     } catch (const CXException& e) {
         CXDLog("A lock token is not written down: %@", e.reason());
     }
@@ -72,9 +133,8 @@ std::optional<LockToken> LockLedger::orphan(const std::string& url) const {
         const std::string text = readFile(path, 16384);
         const size_t first = text.find('\n'), second = text.find('\n', first + 1), third = text.find('\n', second + 1);
         if (third == std::string::npos || text.substr(first + 1, second - first - 1) != url) return std::nullopt;
-        const size_t space = text.find(' ');
-        if (space == std::string::npos || space > first) return std::nullopt;
-        if (startOfProcess(text.substr(0, space)) == text.substr(space + 1, first - space - 1)) return std::nullopt;
+        const std::string process = text.substr(0, first);
+        if (process.find(' ') == std::string::npos || isAlive(process)) return std::nullopt;
         return LockToken(text.substr(second + 1, third - second - 1));
     } catch (const CXException&) {
         return std::nullopt;
@@ -142,7 +202,7 @@ HttpResponse StoreLock::ask(const LockToken& refreshed) {
         r.body = std::make_shared<const std::string>(
             "<?xml version=\"1.0\" encoding=\"utf-8\"?>\n<lockinfo xmlns=\"DAV:\"><lockscope><exclusive/></lockscope>"
             "<locktype><write/></locktype><owner>" +
-            escaped(client->session.account().user.str()) + "</owner></lockinfo>");
+            escaped(client->session.account().user.str() + " " + _ledger.markOfThisRun()) + "</owner></lockinfo>");
     }
     return client->session.send(std::move(r));
 }
@@ -187,10 +247,27 @@ bool StoreLock::takeOver() {
     const std::string where = _endpoint->absoluteString();
     const LockToken abandoned = client ? client->tokens.abandonedFor(where) : LockToken();
     if (isPlausible(abandoned) && take(ask(abandoned), abandoned)) return true;
-    const auto orphan = _ledger.orphan(where);
-    if (!orphan || !isPlausible(*orphan) || !take(ask(*orphan), *orphan)) return false;
-    CXDLog("Took over the lock on %@ of an earlier run", _name);
-    return true;
+    const auto takeOverThe = [this](const std::optional<LockToken>& orphan) {
+        if (!orphan || !isPlausible(*orphan) || !take(ask(*orphan), *orphan)) return false;
+        CXDLog("Took over the lock on %@ of an earlier run", _name);
+        return true;
+    };
+    return takeOverThe(_ledger.orphan(where)) || takeOverThe(tokenOfAnEndedRun());
+}
+
+// Of a run that was killed before it could write the token down.
+std::optional<LockToken> StoreLock::tokenOfAnEndedRun() {
+    const auto client = _client.lock();
+    if (!client) return std::nullopt;
+    HttpRequest r = StoreSession::request("PROPFIND", *_endpoint);
+    r.headers = {{"Depth", "0"}, {"Content-Type", "application/xml; charset=utf-8"}};
+    r.body = std::make_shared<const std::string>("<?xml version=\"1.0\" encoding=\"utf-8\"?>\n<propfind xmlns=\"DAV:\">"
+                                                 "<prop><lockdiscovery/></prop></propfind>");
+    const HttpResponse answer = client->session.send(std::move(r));
+    const auto lock = answer.complete() && answer.status == 207 ? parseLockAnswer(answer.body) : std::nullopt;
+    if (!lock || lock->owner.size() < kMarkLength) return std::nullopt;
+    if (!_ledger.isOfAnEndedRun(lock->owner.substr(lock->owner.size() - kMarkLength))) return std::nullopt;
+    return lock->token;
 }
 
 bool StoreLock::tryLock() {

@@ -97,6 +97,26 @@ TEST_F(Locks, ALockOfARunThatWasKilledIsTakenOverAndOnesOfLivingRunsAreNot) {
     EXPECT_FALSE(mine->renew());
 }
 
+// The answer to its LOCK came too late for it, so the token stands nowhere but on the store.
+TEST_F(Locks, ALockOfARunThatWasKilledBeforeItHeardOfItIsTakenOver) {
+    ASSERT_TRUE(lock(alice)->tryLock());
+    std::filesystem::remove_all(stateDirectory() + "/locks");
+    alice.wire->clear();
+    EXPECT_FALSE(lock(second)->tryLock()) << "its run is this process";
+    for (const auto& run : std::filesystem::directory_iterator(stateDirectory() + "/locks-runs"))
+        writeFileDurably(run.path(), "1 0");
+    auto next = lock(second);
+    EXPECT_TRUE(next->tryLock());
+    EXPECT_EQ(second.write("dateFile", "why"), 204);
+    next->unlock();
+}
+
+TEST_F(Locks, ALockOfAnotherInstallationOrAnotherProgramIsNotTakenOver) {
+    ASSERT_TRUE(lock(alice)->tryLock());
+    for (const char* directory : {"/locks", "/locks-runs"}) std::filesystem::remove_all(stateDirectory() + directory);
+    EXPECT_FALSE(lock(second)->tryLock()) << "nothing is known here of the run that it names";
+}
+
 // Its end would be minutes away, and every pass until then would find its own lock in its way.
 TEST_F(Locks, ALockWhoseReleaseOrRenewalWasNotHeardOfIsTakenOverByTheSameClient) {
     HttpResponse lost;
