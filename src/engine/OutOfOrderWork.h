@@ -36,8 +36,8 @@ public:
     size_t processedCount() const { return _processedCount; } // after wait
     size_t workers() const { return _workers.size(); }
     const CXDChangeRecords& pending() const { return _pending; } // once nobody works any more
-    CXDChangeRecords takePending();   // after finish
-    CXDChangeRecords takeUntouched(); // after finish: what nobody has taken
+    CXDChangeRecords takePending();                              // after finish
+    CXDChangeRecords takeUntouched();                            // after finish: what nobody has taken
 
 private:
     void outOfOrderWorkLoop();
