@@ -252,6 +252,9 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
     CXDLog("Denied:  %@", _parts.denied.all());
     // A change leaves the queue only when the database that took it has it on the disk.
     _parts.with.rolvane.save();
+    // What it holds is known to have come from the store in the same moment: a copy that arrived in a pass which came to
+    // no end would be taken for the user's own addition.
+    _parts.state.putConduitData();
     _parts.state.setPendingChanges(_pendingChanges);
     _queueStored = true;
     const bool lookAgain = noteUnsettled() && _pendingChanges.empty();
