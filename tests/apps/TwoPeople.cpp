@@ -125,8 +125,13 @@ std::map<std::string, std::string> TwoPeople::storeView() {
         const std::string name = group.str();
         const bool isFolder = std::filesystem::is_directory(world.published(name));
         const Dictionary state = dictionary(isFolder ? name + "/" + CXDAVManager::kStateName : name);
-        all[name] = groupText(state[kCXGroupNameProperty].string(),
-                              listText(state["memberUIDState"].array(), [](const Value& v) { return v.string(); }));
+        // Whoever is put into a group while somebody else deletes the contact stays in the list on the store: a name
+        // without a contact, which nobody takes for a member.
+        std::vector<std::string> members;
+        for (const Value& member : state["memberUIDState"].array())
+            if (all.contains(member.string())) members.push_back(member.string());
+        all[name] =
+            groupText(state[kCXGroupNameProperty].string(), listText(members, [](const std::string& v) { return v; }));
     }
     return all;
 }
