@@ -150,6 +150,10 @@ public:
     // everything else unsynchronised of that domain) and into the database (`save`), so that no crash can separate the
     // two: an intent in the preferences covers the time between the two writes. Gives the new count.
     int64_t bumpShareCount(Preferences& preferences);
+    // Where the database is in its history, for what has to be put down in another file before a `save`: a mark to be
+    // stored there, and whether this program has saved to this very database since.
+    Dictionary historyMark();
+    bool hasSavedSince(const Dictionary& mark);
     // At the daemon's start, before any check of the share count: completes a bump that a crash interrupted, if the
     // database still is the one that the intent was made for. Any other database keeps its own count and thus differs.
     void recoverShareCount(Preferences& preferences);

@@ -34,6 +34,21 @@ int64_t CXRolvane::bumpShareCount(Preferences& preferences) {
     return count;
 }
 
+Dictionary CXRolvane::historyMark() {
+    std::lock_guard lock(_impl->mutex);
+    return {{"identity", databaseIdentity()},
+            {"save", _impl->journal.latestSave()},
+            {"token", _impl->journal.latestToken()}};
+}
+
+bool CXRolvane::hasSavedSince(const Dictionary& mark) {
+    std::lock_guard lock(_impl->mutex);
+    const std::string& token = mark["token"].string();
+    if (mark["identity"].string() != databaseIdentity()) return false;
+    if (!token.empty() && !_impl->journal.hasToken(token)) return false; // an earlier copy
+    return _impl->journal.hasSaveOf(_impl->options.program, mark["save"].integer());
+}
+
 void CXRolvane::recoverShareCount(Preferences& preferences) {
     std::lock_guard lock(_impl->mutex);
     ShareCountBump(*this, preferences).recover();

@@ -250,10 +250,17 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
     std::erase_if(_pendingChanges, [&](const CXDChangeRecordPtr& record) { return _parts.denied.contains(*record); });
     CXDLog("Pending: %@", _pendingChanges);
     CXDLog("Denied:  %@", _parts.denied.all());
-    // A change leaves the queue only when the database that took it has it on the disk.
-    _parts.with.rolvane.save();
-    // What it holds is known to have come from the store in the same moment: a copy that arrived in a pass which came to
-    // no end would be taken for the user's own addition.
+    // A change leaves the queue only when the database that took it has it on the disk. And what the database took is
+    // known to have come from the store in the same moment: a copy that arrived in a pass which came to no end would be
+    // taken for the user's own addition.
+    CXRolvane& rolvane = _parts.with.rolvane;
+    if (_inOrderDone > 0) _parts.state.intendConduitData(rolvane.historyMark());
+    try {
+        rolvane.save();
+    } catch (...) {
+        _parts.state.dropIntent(); // another save is to mean nothing of it
+        throw;
+    }
     _parts.state.putConduitData();
     _parts.state.setPendingChanges(_pendingChanges);
     _queueStored = true;

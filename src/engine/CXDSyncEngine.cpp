@@ -45,6 +45,8 @@ void append(CXDChangeRecords& to, CXDChangeRecords&& from) {
 CXDSyncEngine::CXDSyncEngine(const EngineCollaborators& collaborators)
     : _parts(std::make_unique<EngineParts>(collaborators)) {
     _parts->with.account.setFailedPasswordHandler([this] { failedToGetPassword(); });
+    _parts->state.recoverConduitData(
+        [this](const Dictionary& mark) { return _parts->with.rolvane.hasSavedSince(mark); });
     _parts->conduits = _parts->with.makeConduits(*this);
     updateStateAndExitIfNeeded();
     _parts->with.account.updateConfigDataIfNeeded();

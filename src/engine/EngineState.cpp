@@ -53,6 +53,27 @@ void EngineState::setConduitObjectForKey(const std::string& conduitID, const Val
 
 void EngineState::putConduitData() {
     _preferences.set(kDaemonDomain, kCXDConduitData, conduitData());
+    _preferences.remove(kDaemonDomain, kCXDConduitDataIntent);
+}
+
+void EngineState::intendConduitData(const Dictionary& mark) {
+    _preferences.set(kDaemonDomain, kCXDConduitDataIntent, Dictionary{{"data", conduitData()}, {"mark", mark}});
+    _preferences.synchronize(kDaemonDomain);
+}
+
+void EngineState::dropIntent() {
+    _preferences.remove(kDaemonDomain, kCXDConduitDataIntent);
+    _preferences.synchronize(kDaemonDomain);
+}
+
+void EngineState::recoverConduitData(const std::function<bool(const Dictionary& mark)>& hasSavedSince) {
+    const Dictionary intent = _preferences.get(kDaemonDomain, kCXDConduitDataIntent).dictionary();
+    if (intent.empty()) return;
+    if (hasSavedSince(intent["mark"].dictionary()) && intent["data"].isDictionary()) {
+        _preferences.set(kDaemonDomain, kCXDConduitData, intent["data"]);
+        dropConduitData();
+    }
+    dropIntent();
 }
 
 void EngineState::syncPrefs() {

@@ -15,6 +15,7 @@ namespace rolvane {
 // Keys of the daemon's domain.
 inline constexpr const char* kCXDPendingChanges = "CXDPendingChanges";
 inline constexpr const char* kCXDConduitData = "CXDConduitData";
+inline constexpr const char* kCXDConduitDataIntent = "CXDConduitDataIntent";
 inline constexpr const char* kCXDVaultraConduitLastSyncDate = "CXDVaultraConduitLastSyncDate";
 inline constexpr const char* kCXDCXConduitLastSyncDate = "CXDCXConduitLastSyncDate";
 inline constexpr const char* kCXDLocalConduitLastSyncDate = "CXDLocalConduitLastSyncDate";
@@ -40,7 +41,14 @@ public:
     Dictionary conduitObjectForKey(const std::string& conduitID, const std::string& key); // made empty when absent
     void setConduitObjectForKey(const std::string& conduitID, const Value& object, const std::string& key);
     void putConduitData(); // without synchronising
-    void syncPrefs();      // putConduitData, then synchronise
+    // Puts down durably what the conduit data will be once the contact database has been saved: the next
+    // putConduitData takes its place. `mark` is the database's historyMark before that save.
+    void intendConduitData(const Dictionary& mark);
+    void dropIntent();
+    // At the daemon's start, before the conduit data is used: a process that ended between that save and
+    // putConduitData has its intent carried out; one that ended before the save meant nothing.
+    void recoverConduitData(const std::function<bool(const Dictionary& mark)>& hasSavedSince);
+    void syncPrefs(); // putConduitData, then synchronise
 
     // A queue that cannot be read is empty.
     CXDChangeRecords getPendingChanges() const;

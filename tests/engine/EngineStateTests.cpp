@@ -53,6 +53,28 @@ TEST(EngineMemory, WhatIsReadIsACopyThatCanBeChangedWithoutAnyWrite) {
     EXPECT_TRUE(state.conduitObjectForKey("CXDLocal", "priorState").empty());
 }
 
+TEST(EngineMemory, AnIntentIsCarriedOutByTheNextRunWhenTheDatabaseWasSavedAndMeansNothingOtherwise) {
+    for (const bool saved : {true, false}) {
+        World world;
+        world.start();
+        EngineState state(world.preferences);
+        state.setConduitObjectForKey("CXDLocal", Dictionary{{"a", 1}}, "state");
+        state.intendConduitData(world.rolvane->historyMark());
+        if (saved) {
+            world.rolvane->addRecord(CXPerson::create());
+            world.rolvane->save();
+        } else { // somebody else's save says nothing
+            const auto other = world.application();
+            other->addRecord(CXPerson::create());
+            other->save();
+        }
+        EngineState next(world.preferences); // the run ended here
+        next.recoverConduitData([&](const Dictionary& mark) { return world.rolvane->hasSavedSince(mark); });
+        EXPECT_EQ(next.conduitObjectForKey("CXDLocal", "state").empty(), !saved);
+        EXPECT_FALSE(world.stored("CXDConduitDataIntent"));
+    }
+}
+
 TEST(EngineMemory, AMappingWithOneOfItsTwoEndsMissingChangesNothing) {
     World world;
     world.start();
