@@ -70,10 +70,16 @@ void removeOldRuns(const std::string& directory) {
     const auto old = std::filesystem::file_time_type::clock::now() -
                      std::chrono::duration_cast<std::chrono::seconds>(
                          std::chrono::duration<double>(2 * CXWebDAVLock::lockTimeout()));
-    std::error_code ignored;
-    for (const auto& run : std::filesystem::directory_iterator(directory, ignored))
-        if (run.last_write_time(ignored) < old && !isAlive(readFile(run.path(), 4096)))
-            std::filesystem::remove(run.path(), ignored);
+    std::error_code failed;
+    for (std::filesystem::directory_iterator run(directory, failed), end; !failed && run != end; run.increment(failed))
+        try {
+            std::error_code gone; // another program may be clearing up, too
+            const auto written = run->last_write_time(gone);
+            if (!gone && written < old && !isAlive(readFile(run->path(), 4096)))
+                std::filesystem::remove(run->path(), gone);
+        } catch (const CXException& e) {
+            CXDLog("A run's file is left alone: %@", e.reason());
+        }
 }
 
 } // namespace

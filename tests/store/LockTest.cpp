@@ -4,8 +4,11 @@
 #include "store/StoreLock.h"
 #include "support/ChildProcess.h"
 
+#include <chrono>
+#include <filesystem>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <set>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -109,6 +112,23 @@ TEST_F(Locks, ALockOfARunThatWasKilledBeforeItHeardOfItIsTakenOver) {
     EXPECT_TRUE(next->tryLock());
     EXPECT_EQ(second.write("dateFile", "why"), 204);
     next->unlock();
+}
+
+TEST_F(Locks, OldRunsAreForgottenAndWhatElseLiesThereIsNoHindrance) {
+    const std::filesystem::path runs = stateDirectory() + "/locks-runs";
+    std::filesystem::create_directories(runs / "a directory");
+    writeFileDurably(runs / "ended", "1 0");
+    writeFileDurably(runs / "recent", "1 0");
+    const auto longAgo = std::filesystem::file_time_type::clock::now() - std::chrono::hours(24);
+    for (const char* old : {"a directory", "ended"}) std::filesystem::last_write_time(runs / old, longAgo);
+    auto mine = lock(alice);
+    ASSERT_TRUE(mine->tryLock());
+    std::set<std::string> left;
+    for (const auto& run : std::filesystem::directory_iterator(runs)) left.insert(run.path().filename());
+    EXPECT_THAT(left, testing::IsSupersetOf({"a directory", "recent"}));
+    EXPECT_FALSE(left.contains("ended"));
+    EXPECT_EQ(left.size(), 3u) << "and this run's";
+    mine->unlock();
 }
 
 TEST_F(Locks, ALockOfAnotherInstallationOrAnotherProgramIsNotTakenOver) {
