@@ -115,7 +115,8 @@ private:
         auto engine = std::make_unique<CXDSyncEngine>(EngineCollaborators{
             CXRolvane::sharedLocalRolvane(), Preferences::shared(), *_bus, _loop, Clock::system(), _progress,
             _processEnd, *_account, IdleExit::process(), [](const Url& url) { return CXWebDAVLock::initWithURL(url); },
-            [this, &store](ConduitEngine& owner) { return makeConduits(owner, store); }, loginUserName(), nullptr});
+            [this, &store](ConduitEngine& owner) { return makeConduits(owner, store); }, loginUserName(), nullptr,
+            [&store] { releaseLocksOfEndedRuns(store); }});
         _progress.setEngine(engine.get(), engine.get());
         termination().engine = engine.get();
         if (termination().asked) termination().ask(); // it came while the engine was being made

@@ -77,6 +77,8 @@ struct EngineCollaborators {
     ConduitFactory makeConduits;
     std::string loginName;
     std::shared_ptr<InterruptibleSleep> renewalSleep; // none: the steady clock's
+    // Gives back locks on the store that killed runs of this program hold; at each gathering, while the store is there.
+    std::function<void()> releaseLocksOfEndedRuns = {};
 };
 
 } // namespace rolvane

@@ -183,13 +183,25 @@ void CXPathUtils_MakeCompletePath(const std::string& path, mode_t mode) {
     }
 }
 
-void writeFileDurably(const std::string& path, const std::string& contents, mode_t mode) {
+namespace {
+
+void replaceFile(const std::string& path, const std::string& contents, mode_t mode, bool durably) {
     TemporaryFile temporary(path);
     Descriptor& fd = temporary.descriptor();
-    if (::fchmod(fd.get(), mode) != 0 || !writeAll(fd.get(), contents) || ::fsync(fd.get()) != 0 || !fd.close() ||
-        !temporary.renameTo(path))
+    if (::fchmod(fd.get(), mode) != 0 || !writeAll(fd.get(), contents) || (durably && ::fsync(fd.get()) != 0) ||
+        !fd.close() || !temporary.renameTo(path))
         throw cxSystemException("write", path, errno);
-    syncDirectory(parentOf(path));
+    if (durably) syncDirectory(parentOf(path));
+}
+
+} // namespace
+
+void writeFileDurably(const std::string& path, const std::string& contents, mode_t mode) {
+    replaceFile(path, contents, mode, true);
+}
+
+void writeFileWhole(const std::string& path, const std::string& contents, mode_t mode) {
+    replaceFile(path, contents, mode, false);
 }
 
 std::string readFile(const std::string& path, size_t maxBytes) {

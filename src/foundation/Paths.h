@@ -18,6 +18,8 @@ std::string loginUserName();    // of the process's user
 void CXPathUtils_MakeCompletePath(const std::string& path, mode_t mode);
 // Writes a file whole: temporary beside it, fsync, rename, fsync of the directory. CXException on failure.
 void writeFileDurably(const std::string& path, const std::string& contents, mode_t mode = 0600);
+// The same without waiting for the disk: who reads it sees a whole file, but a crash of the machine may take it back.
+void writeFileWhole(const std::string& path, const std::string& contents, mode_t mode = 0600);
 std::string readFile(const std::string& path, size_t maxBytes = 64u << 20); // CXException names path and reason
 
 // A random UUID (version 4) in upper case with hyphens.

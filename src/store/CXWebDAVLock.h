@@ -39,6 +39,9 @@ using LockFactory = std::function<std::shared_ptr<CXWebDAVLock>(const Url&)>;
 class CXDAVManager;
 // A lock on the store of this client. The client may end before the lock; operations then fail.
 std::shared_ptr<CXWebDAVLock> makeStoreLock(CXDAVManager& manager, const Url& url);
+// Gives back what runs of this user that have ended, killed most likely, still hold on the store: until their locks
+// expire, others would wait for nobody. Asks the store only where such a lock is known of. Never throws.
+void releaseLocksOfEndedRuns(CXDAVManager& manager);
 std::shared_ptr<CXWebDAVLock> makeFileLock(const Url& fileUrl, Clock& clock = Clock::system());
 
 } // namespace rolvane

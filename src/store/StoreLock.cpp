@@ -2,152 +2,12 @@
 
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
-#include "foundation/Paths.h"
 #include "store/CXDAVManagerImpl.h"
 
 #include <algorithm>
-#include <chrono>
-#include <cstdio>
 #include <ctime>
-#include <filesystem>
-#include <map>
-#include <unistd.h>
 
 namespace rolvane {
-
-// ---- ledger
-
-LockLedger LockLedger::user() {
-    try {
-        return LockLedger(stateDirectory() + "/locks");
-    } catch (const CXException& e) {
-        CXLog("Lock tokens are not written down: %@", e.reason());
-        return LockLedger("");
-    }
-}
-
-std::string LockLedger::pathFor(const std::string& url) const {
-    uint64_t h = 0xcbf29ce484222325u;
-    for (const char c : url) h = (h ^ static_cast<unsigned char>(c)) * 0x100000001b3u;
-    char name[32];
-    snprintf(name, sizeof name, "/%016llx", static_cast<unsigned long long>(h));
-    return _directory + name;
-}
-
-namespace {
-
-// When the process was started, in the kernel's ticks (field 22 of its stat file); "" when there is no such process.
-// Together with the id it names a process for good.
-std::string startOfProcess(const std::string& pid) {
-    try {
-        const std::string text = readFile("/proc/" + pid + "/stat", 65536);
-        size_t at = text.rfind(')');
-        for (int field = 2; at != std::string::npos && field < 22; ++field) at = text.find(' ', at + 1);
-        return at == std::string::npos ? "" : text.substr(at + 1, text.find(' ', at + 1) - at - 1);
-    } catch (const CXException&) {
-        return {};
-    }
-}
-
-std::string thisProcess() {
-    return std::to_string(getpid()) + " " + startOfProcess("self");
-}
-
-// Of what thisProcess() gave once.
-bool isAlive(const std::string& process) {
-    const size_t space = process.find(' ');
-    return space != std::string::npos && startOfProcess(process.substr(0, space)) == process.substr(space + 1);
-}
-
-constexpr size_t kMarkLength = 36; // a UUID's
-
-bool isAMark(const std::string& text) {
-    return text.size() == kMarkLength && text.find_first_not_of("0123456789ABCDEFabcdef-") == std::string::npos;
-}
-
-// Marks of runs whose locks have all come to their end by now.
-void removeOldRuns(const std::string& directory) {
-    const auto old = std::filesystem::file_time_type::clock::now() -
-                     std::chrono::duration_cast<std::chrono::seconds>(
-                         std::chrono::duration<double>(2 * CXWebDAVLock::lockTimeout()));
-    std::error_code failed;
-    for (std::filesystem::directory_iterator run(directory, failed), end; !failed && run != end; run.increment(failed))
-        try {
-            std::error_code gone; // another program may be clearing up, too
-            const auto written = run->last_write_time(gone);
-            if (!gone && written < old && !isAlive(readFile(run->path(), 4096)))
-                std::filesystem::remove(run->path(), gone);
-        } catch (const CXException& e) {
-            CXDLog("A run's file is left alone: %@", e.reason());
-        }
-}
-
-} // namespace
-
-std::string LockLedger::pathForRun(const std::string& mark) const {
-    return _directory + "-runs/" + mark;
-}
-
-std::string LockLedger::markOfThisRun() const {
-    static std::mutex mutex;
-    static std::map<std::pair<pid_t, std::string>, std::string> marks; // of a process that forked, too
-    if (_directory.empty()) return {};
-    const std::lock_guard guard(mutex);
-    std::string& mark = marks[{getpid(), _directory}];
-    if (!mark.empty() && access(pathForRun(mark).c_str(), R_OK) == 0) return mark;
-    try {
-        CXPathUtils_MakeCompletePath(_directory + "-runs", 0700);
-        removeOldRuns(_directory + "-runs");
-        mark = makeUUID();
-        writeFileDurably(pathForRun(mark), thisProcess());
-    } catch (const CXException& e) {
-        CXDLog("A lock is not marked: %@", e.reason());
-        mark.clear();
-    }
-    return mark;
-}
-
-bool LockLedger::isOfAnEndedRun(const std::string& mark) const {
-    if (_directory.empty() || !isAMark(mark) || access(pathForRun(mark).c_str(), R_OK) != 0) return false;
-    try {
-        return !isAlive(readFile(pathForRun(mark), 4096));
-    } catch (const CXException&) {
-        return false;
-    }
-}
-
-// The file: process id and start, URL and token, a line each.
-void LockLedger::note(const std::string& url, const LockToken& token) {
-    if (_directory.empty()) return;
-    try {
-        CXPathUtils_MakeCompletePath(_directory, 0700);
-        writeFileDurably(pathFor(url), thisProcess() + "\n" + url + "\n" + token.str() + "\n");
-    } catch (const CXException& e) {
-        CXDLog("A lock token is not written down: %@", e.reason());
-    }
-}
-
-void LockLedger::strike(const std::string& url) {
-    if (!_directory.empty()) ::unlink(pathFor(url).c_str());
-}
-
-std::optional<LockToken> LockLedger::orphan(const std::string& url) const {
-    if (_directory.empty()) return std::nullopt;
-    const std::string path = pathFor(url);
-    if (access(path.c_str(), R_OK) != 0) return std::nullopt;
-    try {
-        const std::string text = readFile(path, 16384);
-        const size_t first = text.find('\n'), second = text.find('\n', first + 1), third = text.find('\n', second + 1);
-        if (third == std::string::npos || text.substr(first + 1, second - first - 1) != url) return std::nullopt;
-        const std::string process = text.substr(0, first);
-        if (process.find(' ') == std::string::npos || isAlive(process)) return std::nullopt;
-        return LockToken(text.substr(second + 1, third - second - 1));
-    } catch (const CXException&) {
-        return std::nullopt;
-    }
-}
-
-// ---- lock
 
 namespace {
 
@@ -162,6 +22,10 @@ std::string escaped(const std::string& text) {
             out += c;
     }
     return out;
+}
+
+std::string ownerOf(const UserName& user, const std::string& mark) {
+    return mark.empty() ? user.str() : user.str() + " " + mark;
 }
 
 // Lock-Token: <urn:...> (RFC 4918 section 10.5)
@@ -188,6 +52,32 @@ bool isPlausible(const LockToken& token) {
     return !token.empty() && token.str().size() < 1024 && token.str().find_first_of("<>\r\n ") == std::string::npos;
 }
 
+struct StandingLock {
+    bool answered = false; // the store has said whether there is one
+    std::optional<LockToken> ofAnEndedRun;
+};
+
+// Of a run that was killed before it could write the token down.
+StandingLock lockThere(StoreSession& session, const Url& endpoint, const LockLedger& ledger) {
+    HttpRequest r = StoreSession::request("PROPFIND", endpoint);
+    r.headers = {{"Depth", "0"}, {"Content-Type", "application/xml; charset=utf-8"}};
+    r.body = std::make_shared<const std::string>("<?xml version=\"1.0\" encoding=\"utf-8\"?>\n<propfind xmlns=\"DAV:\">"
+                                                 "<prop><lockdiscovery/></prop></propfind>");
+    const HttpResponse answer = session.send(std::move(r));
+    if (!answer.complete()) return {};
+    if (answer.status != 207) return {isGone(answer) || answer.status == 403, std::nullopt};
+    const auto lock = parseLockAnswer(answer.body);
+    return {true, lock && ledger.isAnEndedRun(lock->owner) ? std::optional(lock->token) : std::nullopt};
+}
+
+// Whether the store knows the lock no more.
+bool release(StoreSession& session, const Url& endpoint, const LockToken& token) {
+    HttpRequest r = StoreSession::request("UNLOCK", endpoint);
+    r.headers = {{"Lock-Token", "<" + token.str() + ">"}};
+    const HttpResponse answer = session.send(std::move(r));
+    return answer.ok() || isGone(answer);
+}
+
 } // namespace
 
 StoreLock::StoreLock(std::shared_ptr<CXDAVManager::Impl> client, Url name, LockLedger ledger, const Clock& clock)
@@ -208,7 +98,7 @@ HttpResponse StoreLock::ask(const LockToken& refreshed) {
         r.body = std::make_shared<const std::string>(
             "<?xml version=\"1.0\" encoding=\"utf-8\"?>\n<lockinfo xmlns=\"DAV:\"><lockscope><exclusive/></lockscope>"
             "<locktype><write/></locktype><owner>" +
-            escaped(client->session.account().user.str() + " " + _ledger.markOfThisRun()) + "</owner></lockinfo>");
+            escaped(ownerOf(client->session.account().user, _ledger.markOfThisRun())) + "</owner></lockinfo>");
     }
     return client->session.send(std::move(r));
 }
@@ -248,32 +138,17 @@ void StoreLock::lose(bool gone) {
 
 // Of a lock that stands on the store: perhaps it is ours, let go of without the store's hearing of it, or that of an
 // earlier run that did not come to release it.
-bool StoreLock::takeOver() {
+bool StoreLock::takeOver(const std::optional<LockToken>& orphan) {
     const auto client = _client.lock();
-    const std::string where = _endpoint->absoluteString();
-    const LockToken abandoned = client ? client->tokens.abandonedFor(where) : LockToken();
+    if (!client) return false;
+    const LockToken abandoned = client->tokens.abandonedFor(_endpoint->absoluteString());
     if (isPlausible(abandoned) && take(ask(abandoned), abandoned)) return true;
-    const auto takeOverThe = [this](const std::optional<LockToken>& orphan) {
-        if (!orphan || !isPlausible(*orphan) || !take(ask(*orphan), *orphan)) return false;
+    const auto takeOverThe = [this](const std::optional<LockToken>& ended) {
+        if (!ended || !isPlausible(*ended) || !take(ask(*ended), *ended)) return false;
         CXDLog("Took over the lock on %@ of an earlier run", _name);
         return true;
     };
-    return takeOverThe(_ledger.orphan(where)) || takeOverThe(tokenOfAnEndedRun());
-}
-
-// Of a run that was killed before it could write the token down.
-std::optional<LockToken> StoreLock::tokenOfAnEndedRun() {
-    const auto client = _client.lock();
-    if (!client) return std::nullopt;
-    HttpRequest r = StoreSession::request("PROPFIND", *_endpoint);
-    r.headers = {{"Depth", "0"}, {"Content-Type", "application/xml; charset=utf-8"}};
-    r.body = std::make_shared<const std::string>("<?xml version=\"1.0\" encoding=\"utf-8\"?>\n<propfind xmlns=\"DAV:\">"
-                                                 "<prop><lockdiscovery/></prop></propfind>");
-    const HttpResponse answer = client->session.send(std::move(r));
-    const auto lock = answer.complete() && answer.status == 207 ? parseLockAnswer(answer.body) : std::nullopt;
-    if (!lock || lock->owner.size() < kMarkLength) return std::nullopt;
-    if (!_ledger.isOfAnEndedRun(lock->owner.substr(lock->owner.size() - kMarkLength))) return std::nullopt;
-    return lock->token;
+    return takeOverThe(orphan) || takeOverThe(lockThere(client->session, *_endpoint, _ledger).ofAnEndedRun);
 }
 
 bool StoreLock::tryLock() {
@@ -281,10 +156,15 @@ bool StoreLock::tryLock() {
     if (locked()) return true;
     if (!_endpoint) return false;
     const std::string where = _endpoint->absoluteString();
+    const auto orphan = _ledger.orphan(where);
+    const bool expected = _ledger.expect(where);
     const HttpResponse answer = ask({});
     // Who may not lock may not write either, and the write is what says so: there is nothing to keep apart from others.
-    if (answer.complete() && answer.status == 403) return true;
-    if (!(answer.status == 423 ? takeOver() : take(answer, {}))) return false;
+    const bool needsNone = answer.complete() && answer.status == 403;
+    if (needsNone || !(answer.status == 423 ? takeOver(orphan) : take(answer, {}))) {
+        if (expected && answer.complete()) _ledger.strike(where);
+        return needsNone;
+    }
     LockToken token;
     {
         std::lock_guard guard(_mutex);
@@ -317,12 +197,7 @@ void StoreLock::unlock() {
     }
     if (token.empty()) return;
     bool gone = false;
-    if (const auto client = _client.lock()) {
-        HttpRequest r = StoreSession::request("UNLOCK", *_endpoint);
-        r.headers = {{"Lock-Token", "<" + token.str() + ">"}};
-        const HttpResponse answer = client->session.send(std::move(r));
-        gone = answer.ok() || isGone(answer);
-    }
+    if (const auto client = _client.lock()) gone = release(client->session, *_endpoint, token);
     lose(gone);
 }
 
@@ -338,6 +213,24 @@ Date StoreLock::expires() const {
 
 std::shared_ptr<CXWebDAVLock> makeStoreLock(CXDAVManager& manager, const Url& url) {
     return std::make_shared<StoreLock>(manager.impl(), url, LockLedger::user());
+}
+
+void releaseLocksOfEndedRuns(CXDAVManager& manager) {
+    LockLedger ledger = LockLedger::user();
+    StoreSession& session = manager.impl()->session;
+    for (const LockLedger::Left& left : ledger.leftByEndedRuns()) {
+        if (!session.nameFor(left.url)) continue; // another account's
+        const Url endpoint(left.url);
+        std::optional<LockToken> token = left.token;
+        if (!isPlausible(*token)) {
+            const StandingLock standing = lockThere(session, endpoint, ledger);
+            token = standing.ofAnEndedRun;
+            if (standing.answered && !token) ledger.strike(left.url);
+        }
+        if (!token || !release(session, endpoint, *token)) continue;
+        ledger.strike(left.url);
+        CXDLog("Released the lock on %@ of an earlier run", left.url);
+    }
 }
 
 std::shared_ptr<CXWebDAVLock> CXWebDAVLock::initWithURL(const Url& url) {

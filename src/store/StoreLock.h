@@ -2,7 +2,7 @@
 
 #include "store/CXDAVManager.h"
 #include "store/CXWebDAVLock.h"
-#include "store/Multistatus.h"
+#include "store/LockLedger.h"
 
 #include <memory>
 #include <mutex>
@@ -10,30 +10,6 @@
 #include <string>
 
 namespace rolvane {
-
-// Remembers the lock token that a process of this user took for a URL, so that the next run can take over the lock of
-// one that was killed. One file a URL below `directory`; empty: remembers nothing. A failure costs a wait, no more.
-//
-// A process may be killed before it hears of the token that it asked for. So a lock's owner, which everybody sees,
-// carries a mark of the process that says nothing to others; which process it is stands below `directory`-runs.
-class LockLedger {
-public:
-    explicit LockLedger(std::string directory) : _directory(std::move(directory)) {}
-    void note(const std::string& url, const LockToken& token);
-    void strike(const std::string& url);
-    // The token of a process that has ended, or nothing.
-    std::optional<LockToken> orphan(const std::string& url) const;
-    // Of this process; written down before it is given out. Empty when it cannot be.
-    std::string markOfThisRun() const;
-    // Whether the mark is that of a process of this user that has ended.
-    bool isOfAnEndedRun(const std::string& mark) const;
-    static LockLedger user(); // in the user's state directory
-
-private:
-    std::string pathFor(const std::string& url) const;
-    std::string pathForRun(const std::string& mark) const;
-    std::string _directory;
-};
 
 // A WebDAV write lock of depth 0 (RFC 4918 sections 6 and 9.10). How long it is good for is measured on a clock that
 // nobody sets and that goes on while the machine sleeps; `clock` only turns that into a date.
@@ -52,8 +28,7 @@ public:
 private:
     HttpResponse ask(const LockToken& refreshed);
     bool take(const HttpResponse& answer, const LockToken& known);
-    bool takeOver();
-    std::optional<LockToken> tokenOfAnEndedRun();
+    bool takeOver(const std::optional<LockToken>& orphan);
     void lose(bool gone);
 
     const std::weak_ptr<CXDAVManager::Impl> _client;

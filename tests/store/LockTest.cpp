@@ -114,6 +114,74 @@ TEST_F(Locks, ALockOfARunThatWasKilledBeforeItHeardOfItIsTakenOver) {
     next->unlock();
 }
 
+// What it leaves on the disk when it is killed with the lock in its hands, or before it hears of the token.
+void killRunsOfThisProcess(bool knewItsToken) {
+    for (const auto& run : std::filesystem::directory_iterator(stateDirectory() + "/locks-runs"))
+        writeFileDurably(run.path(), "1 0");
+    for (const auto& note : std::filesystem::directory_iterator(stateDirectory() + "/locks")) {
+        std::string text = readFile(note.path());
+        text.replace(0, text.find('\n'), "1 0");
+        if (!knewItsToken) text.replace(text.rfind('\n', text.size() - 2), std::string::npos, "\n\n");
+        writeFileDurably(note.path(), text);
+    }
+}
+
+TEST_F(Locks, WhatKilledRunsHoldIsGivenBackWhetherTheyKnewTheirTokenOrNot) {
+    for (const bool knewItsToken : {true, false}) {
+        ASSERT_TRUE(lock(alice)->tryLock());
+        killRunsOfThisProcess(knewItsToken);
+        EXPECT_EQ(second.write("dateFile", "who"), 423);
+        releaseLocksOfEndedRuns(second.manager);
+        EXPECT_EQ(second.write("dateFile", "who"), 204) << second.wire->text();
+        EXPECT_TRUE(std::filesystem::is_empty(stateDirectory() + "/locks"));
+        second.wire->clear();
+        releaseLocksOfEndedRuns(second.manager);
+        EXPECT_EQ(second.wire->methods(), "") << "nothing is known of any more";
+    }
+}
+
+TEST_F(Locks, WhatLivingRunsHoldIsLeftToThem) {
+    auto mine = lock(alice);
+    ASSERT_TRUE(mine->tryLock());
+    second.wire->clear();
+    releaseLocksOfEndedRuns(second.manager);
+    EXPECT_EQ(second.wire->methods(), "");
+    EXPECT_TRUE(mine->renew());
+    mine->unlock();
+}
+
+TEST_F(Locks, ALockThatCouldNotBeGivenBackIsGivenBackAnotherTime) {
+    for (const bool knewItsToken : {true, false}) {
+        ASSERT_TRUE(lock(alice)->tryLock());
+        killRunsOfThisProcess(knewItsToken);
+        HttpResponse lost;
+        lost.error = TransportError::unreachable;
+        second.wire->intercept([&](const HttpRequest&) { return std::optional(lost); });
+        releaseLocksOfEndedRuns(second.manager);
+        second.wire->intercept(nullptr);
+        EXPECT_EQ(second.write("dateFile", "who"), 423);
+        releaseLocksOfEndedRuns(second.manager);
+        EXPECT_EQ(second.write("dateFile", "who"), 204);
+    }
+}
+
+TEST_F(Locks, AnAskedLockIsNotedBeforeItIsHadAndARefusedOneIsStruck) {
+    bool noted = false;
+    alice.wire->intercept([&](const HttpRequest& request) -> std::optional<HttpResponse> {
+        if (request.method == "LOCK") noted = !std::filesystem::is_empty(stateDirectory() + "/locks");
+        return std::nullopt;
+    });
+    auto mine = lock(alice);
+    ASSERT_TRUE(mine->tryLock());
+    EXPECT_TRUE(noted);
+    const std::string note = readFile(std::filesystem::directory_iterator(stateDirectory() + "/locks")->path());
+    EXPECT_FALSE(lock(second)->tryLock());
+    EXPECT_EQ(readFile(std::filesystem::directory_iterator(stateDirectory() + "/locks")->path()), note)
+        << "the holder's stays";
+    mine->unlock();
+    EXPECT_TRUE(std::filesystem::is_empty(stateDirectory() + "/locks"));
+}
+
 TEST_F(Locks, OldRunsAreForgottenAndWhatElseLiesThereIsNoHindrance) {
     const std::filesystem::path runs = stateDirectory() + "/locks-runs";
     std::filesystem::create_directories(runs / "a directory");
