@@ -19,6 +19,8 @@ public:
     virtual Dictionary conduitObjectForKey(const std::string& conduitID, const std::string& key) = 0;
     virtual void setConduitObjectForKey(const std::string& conduitID, const Value& object, const std::string& key) = 0;
     virtual void syncPrefs() = 0;
+    // Before a pass's changes are saved to the contact database while more of them are to come. Main thread.
+    virtual void willSaveInThePass() {}
 
     virtual bool isRevoked(const RemoteLocation& location) const = 0;
     virtual std::vector<RemoteLocation> revokedRemoteLocations() const = 0;

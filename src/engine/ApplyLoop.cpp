@@ -2,6 +2,7 @@
 
 #include "contacts/CXRolvane.h"
 #include "contacts/Identifier.h"
+#include "engine/Arrivals.h"
 #include "engine/ChangeQueue.h"
 #include "engine/GoneThings.h"
 #include "engine/Mingler.h"
@@ -67,6 +68,19 @@ public:
 
 private:
     CXFileManager* _manager = nullptr; // of the network store, the one that a pass reads
+};
+
+class NotingArrivals {
+public:
+    NotingArrivals(EngineParts& parts, std::function<void()> note) : _parts(parts) {
+        _parts.beforeSaveInThePass = std::move(note);
+    }
+    ~NotingArrivals() { _parts.beforeSaveInThePass = {}; }
+    NotingArrivals(const NotingArrivals&) = delete;
+    NotingArrivals& operator=(const NotingArrivals&) = delete;
+
+private:
+    EngineParts& _parts;
 };
 
 } // namespace
@@ -160,6 +174,7 @@ void ApplyLoop::applyOutOfOrder() {
 
 void ApplyLoop::applyInOrder() {
     const ReadingAhead ahead(_inOrder);
+    const NotingArrivals noting(_parts, [this] { noteArrivals(); });
     for (; _inOrderDone < _inOrder.size(); ++_inOrderDone) {
         const CXDChangeRecordPtr& record = _inOrder[_inOrderDone];
         applyInOrder(record);
@@ -180,6 +195,19 @@ bool ApplyLoop::meetsOwnWaitingWrite(const CXDChangeRecord& record) {
     }
     return !_waitingWrites->empty() &&
            _waitingWrites->contains({record.user().value_or(UserName()), cxNormalizedUID(*record.person())});
+}
+
+// Once a pass: what is noted then is good for all saves that follow.
+void ApplyLoop::noteArrivals() {
+    if (std::exchange(_arrivalsNoted, true)) return;
+    claimState();
+    _parts.state.intendArrivals(_parts.with.rolvane.historyMark(), arrivalsAmong(_inOrder, _inOrderDone));
+}
+
+// A first pass has this done long before it ends. Killed behind its first save, it would be a first pass again, for
+// which nothing of what is there came from a store.
+void ApplyLoop::claimState() {
+    _parts.state.claim(_parts.with.rolvane.shareCount(), _parts.with.account.vaultraUser());
 }
 
 void ApplyLoop::applyInOrder(const CXDChangeRecordPtr& record) {
@@ -254,6 +282,7 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
     // known to have come from the store in the same moment: a copy that arrived in a pass which came to no end would be
     // taken for the user's own addition.
     CXRolvane& rolvane = _parts.with.rolvane;
+    claimState();
     if (_inOrderDone > 0) _parts.state.intendConduitData(rolvane.historyMark());
     try {
         rolvane.save();
@@ -295,6 +324,7 @@ void ApplyLoop::bumpShareCount() {
     } catch (const CXException& e) {
         CXLog("applyChangeRecords: Caught %@: %@", e.name(), e.reason());
         _parts.state.dropConduitData();
+        recoverConduitData(_parts); // what was saved in the middle of the pass is there
         return;
     }
     try {

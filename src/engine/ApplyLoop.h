@@ -42,6 +42,8 @@ private:
     void applyOutOfOrder();
     void applyInOrder();
     void applyInOrder(const CXDChangeRecordPtr& record);
+    void noteArrivals();
+    void claimState();
     bool meetsOwnWaitingWrite(const CXDChangeRecord& record);
     bool applyTo(CXDConduit& conduit, int32_t source, const CXDChangeRecordPtr& record);
     void cancelLike(const CXDChangeRecordPtr& record);
@@ -60,6 +62,7 @@ private:
     Dictionary _unsettled; // groups whose changes may have been lost, or applied in another order than they were made
     CXDChangeRecords _inOrder;
     size_t _inOrderDone = 0;
+    bool _arrivalsNoted = false; // for a save in the middle of the pass
     std::unique_ptr<OutOfOrderWork> _outOfOrder;
     bool _denied = false; // handed to every in-order apply; never cleared in a pass
     std::unordered_set<UserName> _cancelledUsers;

@@ -45,8 +45,7 @@ void append(CXDChangeRecords& to, CXDChangeRecords&& from) {
 CXDSyncEngine::CXDSyncEngine(const EngineCollaborators& collaborators)
     : _parts(std::make_unique<EngineParts>(collaborators)) {
     _parts->with.account.setFailedPasswordHandler([this] { failedToGetPassword(); });
-    _parts->state.recoverConduitData(
-        [this](const Dictionary& mark) { return _parts->with.rolvane.hasSavedSince(mark); });
+    recoverConduitData(*_parts);
     _parts->conduits = _parts->with.makeConduits(*this);
     updateStateAndExitIfNeeded();
     _parts->with.account.updateConfigDataIfNeeded();
@@ -198,6 +197,7 @@ CXDChangeRecords CXDSyncEngine::gather() {
         conduits.cx->open();
         conduits.vaultra->open();
         append(gathered, conduits.cx->changeRecords());
+        if (_parts->with.releaseLocksOfEndedRuns && !_parts->vaultraOffLine()) _parts->with.releaseLocksOfEndedRuns();
         if (!_parts->vaultraOffLine()) append(gathered, conduits.vaultra->changeRecords());
     } catch (const CXException& e) {
         CXLog("bringSourcesUpToDate: Caught %@: %@", e.name(), e.reason());
@@ -263,6 +263,9 @@ Dictionary CXDSyncEngine::knownGroupState(const std::string& conduitID, const Us
         known = state.deepMutableCopy().dictionary();
     });
     return known;
+}
+void CXDSyncEngine::willSaveInThePass() {
+    if (_parts->beforeSaveInThePass) _parts->beforeSaveInThePass();
 }
 void CXDSyncEngine::syncPrefs() {
     _parts->state.syncPrefs();

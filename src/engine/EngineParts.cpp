@@ -1,6 +1,7 @@
 #include "engine/EngineParts.h"
 
 #include "contacts/CXRolvane.h"
+#include "engine/Arrivals.h"
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
 #include "model/PayloadKeys.h"
@@ -72,6 +73,21 @@ void checkCXShareCount(EngineParts& parts) {
     const std::optional<std::string> last = preferences.get(kDaemonDomain, kCXDLastOstrelUser).optionalString();
     const std::optional<UserName> user = parts.with.account.vaultraUser();
     if (!user || !last || user->str() != *last) parts.state.reset();
+}
+
+void recoverConduitData(EngineParts& parts) {
+    CXRolvane& rolvane = parts.with.rolvane;
+    const std::optional<UserName> own = parts.with.account.vaultraUser();
+    const auto locationOf = [&](const UserName& user) -> std::optional<RemoteLocation> {
+        if (user == kSelf) return RemoteLocation();
+        for (const CXSubscriptionRef& subscription : rolvane.subscriptions())
+            if (userForRemoteLocation(subscription->remoteLocation(), own, parts.with.loginName) == user)
+                return subscription->remoteLocation();
+        return std::nullopt;
+    };
+    parts.state.recoverConduitData(
+        [&](const Dictionary& mark) { return rolvane.hasSavedSince(mark); },
+        [&](Dictionary& data, const Array& arrivals) { foldArrivals(data, arrivals, rolvane, locationOf); });
 }
 
 void updateStateAndExitIfNeeded(EngineParts& parts) {

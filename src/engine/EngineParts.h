@@ -25,9 +25,10 @@ struct EngineParts {
     Revocation revoked;
     RemoteLocks locks;
     EngineConduits conduits;
-    std::atomic<bool> terminating{false}; // passes wind down: what is not applied yet stays pending
-    mutable bool ending = false;          // killCXD has begun; main thread
-    bool retryScheduled = false;          // a retry pass waits on the run loop; main thread
+    std::atomic<bool> terminating{false};      // passes wind down: what is not applied yet stays pending
+    mutable bool ending = false;               // killCXD has begun; main thread
+    bool retryScheduled = false;               // a retry pass waits on the run loop; main thread
+    std::function<void()> beforeSaveInThePass; // while changes are applied in order; main thread
     const std::thread::id mainThread = std::this_thread::get_id();
 
     bool vaultraOffLine() const { return conduits.vaultraOffLine && conduits.vaultraOffLine(); }
@@ -39,6 +40,8 @@ struct EngineParts {
 
 // checkCXShareCount: forgets everything when the database is not the one of the last pass, or the account is another.
 void checkCXShareCount(EngineParts& parts);
+// Carries out what a pass meant to remember that has saved the database and come to no end.
+void recoverConduitData(EngineParts& parts);
 // updateStateAndExitIfNeeded: without an account no remote subscription and no publication are left; with nothing
 // published and fewer than two subscriptions the process ends.
 void updateStateAndExitIfNeeded(EngineParts& parts);

@@ -54,6 +54,7 @@ void EngineState::setConduitObjectForKey(const std::string& conduitID, const Val
 void EngineState::putConduitData() {
     _preferences.set(kDaemonDomain, kCXDConduitData, conduitData());
     _preferences.remove(kDaemonDomain, kCXDConduitDataIntent);
+    _preferences.remove(kDaemonDomain, kCXDArrivalsIntent);
 }
 
 void EngineState::intendConduitData(const Dictionary& mark) {
@@ -66,13 +67,29 @@ void EngineState::dropIntent() {
     _preferences.synchronize(kDaemonDomain);
 }
 
-void EngineState::recoverConduitData(const std::function<bool(const Dictionary& mark)>& hasSavedSince) {
-    const Dictionary intent = _preferences.get(kDaemonDomain, kCXDConduitDataIntent).dictionary();
-    if (intent.empty()) return;
-    if (hasSavedSince(intent["mark"].dictionary()) && intent["data"].isDictionary()) {
-        _preferences.set(kDaemonDomain, kCXDConduitData, intent["data"]);
-        dropConduitData();
+void EngineState::intendArrivals(const Dictionary& mark, const Array& arrivals) {
+    _preferences.set(kDaemonDomain, kCXDArrivalsIntent,
+                     Dictionary{{"data", conduitData()}, {"mark", mark}, {"arrivals", arrivals}});
+    _preferences.synchronize(kDaemonDomain);
+}
+
+void EngineState::recoverConduitData(const std::function<bool(const Dictionary& mark)>& hasSavedSince,
+                                     const std::function<void(Dictionary& data, const Array& arrivals)>& fold) {
+    const Dictionary whole = _preferences.get(kDaemonDomain, kCXDConduitDataIntent).dictionary();
+    const Dictionary part = _preferences.get(kDaemonDomain, kCXDArrivalsIntent).dictionary();
+    if (whole.empty() && part.empty()) return;
+    const auto counts = [&](const Dictionary& intent) {
+        return intent["data"].isDictionary() && hasSavedSince(intent["mark"].dictionary());
+    };
+    if (counts(whole)) {
+        _preferences.set(kDaemonDomain, kCXDConduitData, whole["data"]);
+    } else if (counts(part)) {
+        Dictionary data = part["data"].deepMutableCopy().dictionary();
+        fold(data, part["arrivals"].array());
+        _preferences.set(kDaemonDomain, kCXDConduitData, data);
     }
+    dropConduitData();
+    _preferences.remove(kDaemonDomain, kCXDArrivalsIntent);
     dropIntent();
 }
 
@@ -176,11 +193,17 @@ void EngineState::forgetUser(const UserName& user) {
         setPendingChanges(pending);
 }
 
+void EngineState::claim(int64_t shareCount, const std::optional<UserName>& user) {
+    if (!_preferences.get(kDaemonDomain, kCXDShareCount)) _preferences.set(kDaemonDomain, kCXDShareCount, shareCount);
+    if (user && !_preferences.get(kDaemonDomain, kCXDLastOstrelUser))
+        _preferences.set(kDaemonDomain, kCXDLastOstrelUser, *user);
+}
+
 void EngineState::reset() {
     CXDLog("Reset!");
-    for (const char* key :
-         {kCXDPendingChanges, kCXDConduitData, kCXDVaultraConduitLastSyncDate, kCXDCXConduitLastSyncDate,
-          kCXDLocalConduitLastSyncDate, kCXDShareCount, kCXDLastOstrelUser, kCXDUnsavedAccessLists})
+    for (const char* key : {kCXDPendingChanges, kCXDConduitData, kCXDVaultraConduitLastSyncDate,
+                            kCXDCXConduitLastSyncDate, kCXDLocalConduitLastSyncDate, kCXDShareCount, kCXDLastOstrelUser,
+                            kCXDUnsavedAccessLists, kCXDConduitDataIntent, kCXDArrivalsIntent})
         _preferences.remove(kDaemonDomain, key);
     _preferences.synchronize(kDaemonDomain);
     dropConduitData();

@@ -16,6 +16,7 @@ namespace rolvane {
 inline constexpr const char* kCXDPendingChanges = "CXDPendingChanges";
 inline constexpr const char* kCXDConduitData = "CXDConduitData";
 inline constexpr const char* kCXDConduitDataIntent = "CXDConduitDataIntent";
+inline constexpr const char* kCXDArrivalsIntent = "CXDArrivalsIntent";
 inline constexpr const char* kCXDVaultraConduitLastSyncDate = "CXDVaultraConduitLastSyncDate";
 inline constexpr const char* kCXDCXConduitLastSyncDate = "CXDCXConduitLastSyncDate";
 inline constexpr const char* kCXDLocalConduitLastSyncDate = "CXDLocalConduitLastSyncDate";
@@ -45,9 +46,13 @@ public:
     // putConduitData takes its place. `mark` is the database's historyMark before that save.
     void intendConduitData(const Dictionary& mark);
     void dropIntent();
-    // At the daemon's start, before the conduit data is used: a process that ended between that save and
-    // putConduitData has its intent carried out; one that ended before the save meant nothing.
-    void recoverConduitData(const std::function<bool(const Dictionary& mark)>& hasSavedSince);
+    // The same before a save in the middle of a pass, which puts a part of the arrivals (engine/Arrivals.h) on the disk
+    // together with what the conduit data says already. Good for all later saves of the pass, until putConduitData.
+    void intendArrivals(const Dictionary& mark, const Array& arrivals);
+    // At the daemon's start, and when a pass could not save, before the conduit data is used: a pass that ended between
+    // such a save and putConduitData has its intent carried out; what is meant for a save that never came is dropped.
+    void recoverConduitData(const std::function<bool(const Dictionary& mark)>& hasSavedSince,
+                            const std::function<void(Dictionary& data, const Array& arrivals)>& fold);
     void syncPrefs(); // putConduitData, then synchronise
 
     // A queue that cannot be read is empty.
@@ -71,6 +76,9 @@ public:
     // What both conduits remember of the user, and the user's changes in the queue (durably). Nothing else is written.
     void forgetUser(const UserName& user);
 
+    // What is remembered counts only together with the database's share count and the account's user: where they are
+    // missing they are put down with it. Without synchronising.
+    void claim(int64_t shareCount, const std::optional<UserName>& user);
     void reset(); // forgets everything, durably
     Preferences& preferences() const { return _preferences; }
 

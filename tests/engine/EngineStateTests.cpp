@@ -69,7 +69,8 @@ TEST(EngineMemory, AnIntentIsCarriedOutByTheNextRunWhenTheDatabaseWasSavedAndMea
             other->save();
         }
         EngineState next(world.preferences); // the run ended here
-        next.recoverConduitData([&](const Dictionary& mark) { return world.rolvane->hasSavedSince(mark); });
+        next.recoverConduitData([&](const Dictionary& mark) { return world.rolvane->hasSavedSince(mark); },
+                                [](Dictionary&, const Array&) { FAIL() << "nothing was saved in the middle"; });
         EXPECT_EQ(next.conduitObjectForKey("CXDLocal", "state").empty(), !saved);
         EXPECT_FALSE(world.stored("CXDConduitDataIntent"));
     }

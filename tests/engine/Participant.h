@@ -10,6 +10,7 @@
 #include "contacts/Identifier.h"
 #include "store/CXNetworkController.h"
 
+#include <filesystem>
 #include <map>
 #include <set>
 
@@ -60,8 +61,10 @@ struct NoProgress : ProgressReporter {
 // application is a second handle on the database.
 class Participant {
 public:
-    Participant(const StoreWorld& world, const std::string& user)
-        : name(user), wire(std::make_shared<RecordingTransport>(std::make_shared<EverybodysKeys>(world))),
+    // `disk`: the directory of one who was killed, whose files this one goes on with, as they are now.
+    Participant(const StoreWorld& world, const std::string& user, const std::string& disk = {})
+        : name(user), directory(disk),
+          wire(std::make_shared<RecordingTransport>(std::make_shared<EverybodysKeys>(world))),
           manager(world.account(user), wire), base(manager.account().baseLocationFor(UserName(user)).absoluteString()) {
         account.user = UserName(user);
         application = std::make_unique<CXRolvane>(
@@ -158,7 +161,14 @@ public:
     }
 
     const std::string name;
-    TempDirectory directory;
+    struct Directory : TempDirectory {
+        explicit Directory(const std::string& disk) {
+            if (disk.empty()) return;
+            for (const auto& entry : std::filesystem::directory_iterator(disk))
+                if (!entry.path().string().ends_with("-shm")) // of the processes that have it open
+                    std::filesystem::copy(entry.path(), path(), std::filesystem::copy_options::recursive);
+        }
+    } directory;
     std::shared_ptr<RecordingTransport> wire;
     CXDAVManager manager;
     const std::string base;

@@ -1,5 +1,7 @@
 #include "support/ChildProcess.h"
 
+#include "support/TerminationTrace.h"
+
 #include <array>
 #include <cerrno>
 #include <chrono>
@@ -82,6 +84,7 @@ int milliseconds(double seconds) {
 } // namespace
 
 ChildProcess::ChildProcess(Options options) {
+    traceTermination();
     start(options);
     if (!options.input.empty()) {
         writeInput(options.input);
