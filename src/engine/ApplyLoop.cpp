@@ -8,6 +8,7 @@
 #include "engine/Mingler.h"
 #include "engine/OutOfOrderWork.h"
 #include "engine/PublicationCache.h"
+#include "engine/UnderWay.h"
 #include "engine/UnsettledGroups.h"
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
@@ -135,8 +136,12 @@ void ApplyLoop::applyAll(bool trickle) {
     const size_t fresh = _unhandled.size();
     append(_unhandled, _parts.state.getPendingChanges());
     _queueTaken = true;
+    _formerlyUnderWay = _parts.state.underWay(); // of a pass that was killed
     _unsettled = unsettledGroups(_unhandled, fresh);
     withdrawWhatIsGone(_unhandled, fresh, _parts.with.rolvane);
+    if (!_formerlyUnderWay.empty())
+        _parts.state.withConduitData(
+            [&](Dictionary& data) { settleUnderWay(_formerlyUnderWay, _unhandled, data, _parts.with.rolvane); });
     queue();
     _parts.with.progress.startedPhase(3);
     split();
@@ -163,7 +168,18 @@ void ApplyLoop::split() {
     for (CXDChangeRecordPtr& record : _unhandled)
         (record->canApplyOutOfOrder() ? outOfOrder : _inOrder).push_back(std::move(record));
     _unhandled.clear();
+    const Dictionary now = underWay(outOfOrder);
     _outOfOrder = std::make_unique<OutOfOrderWork>(_parts, std::move(outOfOrder));
+    if (!now.empty()) noteUnderWay(now);
+}
+
+// What cannot be noted is done all the same: a full disk does not keep the store out of step.
+void ApplyLoop::noteUnderWay(const Dictionary& now) {
+    try {
+        _parts.state.setUnderWay(underWayTogether(_formerlyUnderWay, now));
+    } catch (const CXException& e) {
+        CXLog("applyChangeRecords: Caught %@: %@", e.name(), e.reason());
+    }
 }
 
 void ApplyLoop::applyOutOfOrder() {
@@ -330,6 +346,7 @@ void ApplyLoop::bumpShareCount() {
     try {
         preferences.set(kDaemonDomain, kCXDLastOstrelUser, user ? Value(*user) : Value());
         _parts.state.putConduitData();
+        if (_queueStored) _parts.state.removeUnderWay();
         _parts.with.rolvane.bumpShareCount(preferences);
         preferences.synchronize(kDaemonDomain);
     } catch (const CXException& e) {

@@ -39,6 +39,7 @@ private:
     void applyAll(bool trickle);
     void queue(); // _unhandled becomes the flat list
     void split();
+    void noteUnderWay(const Dictionary& now);
     void applyOutOfOrder();
     void applyInOrder();
     void applyInOrder(const CXDChangeRecordPtr& record);
@@ -60,6 +61,7 @@ private:
     bool _queueStored = false;
     CXDChangeRecords _pendingChanges;
     Dictionary _unsettled; // groups whose changes may have been lost, or applied in another order than they were made
+    Dictionary _formerlyUnderWay;
     CXDChangeRecords _inOrder;
     size_t _inOrderDone = 0;
     bool _arrivalsNoted = false; // for a save in the middle of the pass

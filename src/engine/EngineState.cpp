@@ -125,6 +125,19 @@ void EngineState::setPendingChanges(const CXDChangeRecords& records) {
     _preferences.synchronize(kDaemonDomain);
 }
 
+void EngineState::removeUnderWay() {
+    _preferences.remove(kDaemonDomain, kCXDUnderWay);
+}
+
+Dictionary EngineState::underWay() const {
+    return _preferences.get(kDaemonDomain, kCXDUnderWay).dictionary();
+}
+
+void EngineState::setUnderWay(const Dictionary& underWay) {
+    _preferences.set(kDaemonDomain, kCXDUnderWay, underWay);
+    _preferences.synchronize(kDaemonDomain);
+}
+
 void EngineState::noteRefusedChanges(const CXDChangeRecords& records, Date when) {
     constexpr size_t kKept = 20;
     std::map<std::string, int64_t> byUser;
@@ -203,7 +216,7 @@ void EngineState::reset() {
     CXDLog("Reset!");
     for (const char* key : {kCXDPendingChanges, kCXDConduitData, kCXDVaultraConduitLastSyncDate,
                             kCXDCXConduitLastSyncDate, kCXDLocalConduitLastSyncDate, kCXDShareCount, kCXDLastOstrelUser,
-                            kCXDUnsavedAccessLists, kCXDConduitDataIntent, kCXDArrivalsIntent})
+                            kCXDUnsavedAccessLists, kCXDConduitDataIntent, kCXDArrivalsIntent, kCXDUnderWay})
         _preferences.remove(kDaemonDomain, key);
     _preferences.synchronize(kDaemonDomain);
     dropConduitData();

@@ -17,6 +17,7 @@ inline constexpr const char* kCXDPendingChanges = "CXDPendingChanges";
 inline constexpr const char* kCXDConduitData = "CXDConduitData";
 inline constexpr const char* kCXDConduitDataIntent = "CXDConduitDataIntent";
 inline constexpr const char* kCXDArrivalsIntent = "CXDArrivalsIntent";
+inline constexpr const char* kCXDUnderWay = "CXDUnderWay"; // engine/UnderWay.h
 inline constexpr const char* kCXDVaultraConduitLastSyncDate = "CXDVaultraConduitLastSyncDate";
 inline constexpr const char* kCXDCXConduitLastSyncDate = "CXDCXConduitLastSyncDate";
 inline constexpr const char* kCXDLocalConduitLastSyncDate = "CXDLocalConduitLastSyncDate";
@@ -58,6 +59,11 @@ public:
     // A queue that cannot be read is empty.
     CXDChangeRecords getPendingChanges() const;
     void setPendingChanges(const CXDChangeRecords& records);
+
+    // What a pass is about to put on the store: from before its first write, durably, to its very end.
+    Dictionary underWay() const;
+    void setUnderWay(const Dictionary& underWay);
+    void removeUnderWay(); // without synchronising
 
     // Adds what a pass was refused; the oldest are forgotten. Without synchronising.
     void noteRefusedChanges(const CXDChangeRecords& records, Date when);

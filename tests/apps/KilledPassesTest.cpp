@@ -1,8 +1,11 @@
 // Passes of a subscriber's daemon that are killed.
 
 #include "TwoPeople.h"
+#include "foundation/PropertyList.h"
 
+#include <algorithm>
 #include <chrono>
+#include <functional>
 
 namespace rolvane::test {
 namespace {
@@ -58,11 +61,99 @@ TEST_F(KilledSubscriber, AtAnyMomentOfAPassLosesNothingAndDoublesNothingAfterCle
     cleanPass();          // gives back the lock that a killed one has left on her tree
     world.done({"sync"}); // all of hers is on the store
     const std::string said = cleanPass();
-    expectEqual(storeView(), view(*bob), "bob's database\n" + said);
+    expectEqual(storeView(Names::ofContacts), view(*bob), "bob's database\n" + said);
     expectEverySurvivingNameWasWritten(*bob);
     world.done({"sync"});
-    expectEqual(storeView(), view(*alice), "alice's database");
+    expectEqual(storeView(Names::ofContacts), view(*alice), "alice's database");
     for (const auto& [name, text] : view(*bob)) EXPECT_EQ(text.find("twice"), std::string::npos) << name << text;
+}
+
+class KilledPublisher : public TwoPeople {
+protected:
+    KilledPublisher() : TwoPeople(60) { world.rolvane({"daemon", "stop"}); }
+
+    CXGroupRef anyGroup() { return groupOf(*alice, random() % kGroups); }
+    CXPersonRef anybody() { return personOf(*alice, random() % people.size()); }
+
+    // Several changes in one save, and how to take them back.
+    void change(int number) {
+        const auto newcomer = CXPerson::create();
+        newcomer->setValue(Value("New " + std::to_string(number)), kCXFirstNameProperty);
+        alice->addRecord(newcomer);
+        const CXGroupRef joined = anyGroup();
+        joined->addMember(newcomer);
+        const auto made = CXGroup::create();
+        made->setValue(Value("Made " + std::to_string(number)), kCXGroupNameProperty);
+        alice->addRecord(made);
+        made->addMember(anybody());
+        const CXGroupRef named = anyGroup(), entered = anyGroup(), left = anyGroup();
+        const std::string name = named->name();
+        named->setValue(Value(name + "!"), kCXGroupNameProperty);
+        const CXPersonRef enters = anybody(), leaves = anybody();
+        const auto isIn = [](const CXGroupRef& group, const CXPersonRef& person) {
+            const auto members = group->memberUniqueIds();
+            return std::find(members.begin(), members.end(), person->uniqueId()) != members.end();
+        };
+        const bool wasIn = isIn(entered, enters), wasThere = isIn(left, leaves);
+        entered->addMember(enters);
+        left->removeMember(leaves);
+        alice->save();
+        undo = [=, this] {
+            alice->removeRecord(newcomer);
+            alice->removeRecord(made);
+            named->setValue(Value(name), kCXGroupNameProperty);
+            wasIn ? (void)entered->addMember(enters) : (void)entered->removeMember(enters);
+            wasThere ? (void)left->addMember(leaves) : (void)left->removeMember(leaves);
+            alice->save();
+        };
+        keep = [=, this] {
+            people.push_back(newcomer->uniqueId());
+            alice->removeRecord(made);
+            alice->save();
+        };
+    }
+    void cleanPass() {
+        const auto daemon = world.startManager({"-p"});
+        const auto ending = daemon->wait(kPatience);
+        EXPECT_TRUE(ending && ending->exitedWith(0)) << daemon->errors();
+    }
+    std::set<std::string> filesOnTheStore() {
+        std::set<std::string> files;
+        for (const std::string& path : world.tree())
+            if (path.starts_with("People/")) files.insert(path.substr(path.rfind('/') + 1));
+        return files;
+    }
+    std::function<void()> undo, keep;
+};
+
+TEST_F(KilledPublisher, LeavesNothingOnTheStoreOfWhatIsTakenBackBeforeTheNextPass) {
+    constexpr int kKills = 30;
+    double whole = 0.3; // seconds that a pass takes, about
+    int inTheMiddle = 0;
+    for (int kill = 0; kill < kKills; ++kill) {
+        change(kill);
+        const auto daemon = world.startManager({"-p"});
+        const auto start = std::chrono::steady_clock::now();
+        if (daemon->wait(std::uniform_real_distribution<double>(0, whole)(random))) {
+            whole = std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
+        } else {
+            daemon->kill();
+            ++inTheMiddle;
+        }
+        kill % 4 == 0 ? keep() : undo();
+    }
+    EXPECT_GE(inTheMiddle, kKills / 2) << "the passes were faster than the kills";
+
+    cleanPass();
+    expectEqual(storeView(), view(*alice), "alice's database");
+    EXPECT_EQ(filesOnTheStore().size(), people.size());
+    const Dictionary all = PropertyList::fromXML(contentsOf(world.published("AllCXGroup"))).dictionary();
+    EXPECT_EQ(all["memberUIDState"].array().count(), people.size());
+    EXPECT_EQ(all["subgroupUIDState"].array().count(), kGroups);
+    std::set<std::string> groupsThere;
+    for (const std::string& path : world.tree())
+        if (const std::string top = path.substr(0, path.find('/')); top.ends_with(":CXGroup")) groupsThere.insert(top);
+    EXPECT_EQ(groupsThere.size(), kGroups);
 }
 
 } // namespace

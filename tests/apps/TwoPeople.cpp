@@ -110,7 +110,7 @@ std::map<std::string, std::string> TwoPeople::view(CXRolvane& database) const {
     return all;
 }
 
-std::map<std::string, std::string> TwoPeople::storeView() {
+std::map<std::string, std::string> TwoPeople::storeView(Names named) {
     std::map<std::string, std::string> all;
     const auto dictionary = [&](const std::string& path) {
         return PropertyList::fromXML(contentsOf(world.published(path))).dictionary();
@@ -125,11 +125,9 @@ std::map<std::string, std::string> TwoPeople::storeView() {
         const std::string name = group.str();
         const bool isFolder = std::filesystem::is_directory(world.published(name));
         const Dictionary state = dictionary(isFolder ? name + "/" + CXDAVManager::kStateName : name);
-        // Whoever is put into a group while somebody else deletes the contact stays in the list on the store: a name
-        // without a contact, which nobody takes for a member.
         std::vector<std::string> members;
         for (const Value& member : state["memberUIDState"].array())
-            if (all.contains(member.string())) members.push_back(member.string());
+            if (named == Names::all || all.contains(member.string())) members.push_back(member.string());
         all[name] =
             groupText(state[kCXGroupNameProperty].string(), listText(members, [](const std::string& v) { return v; }));
     }

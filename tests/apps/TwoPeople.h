@@ -26,7 +26,10 @@ protected:
     void edit(CXRolvane& database, const std::string& who, int number);
     // What a database holds of alice's, by record; and what the store holds. Lists that name somebody twice say so.
     std::map<std::string, std::string> view(CXRolvane& database) const;
-    std::map<std::string, std::string> storeView();
+    // Whoever is put into a group while somebody else deletes the contact stays in the list on the store: a name
+    // without a contact, which nobody takes for a member. Where two write at a time such names are left out.
+    enum class Names { all, ofContacts };
+    std::map<std::string, std::string> storeView(Names named = Names::all);
     void expectEqual(const std::map<std::string, std::string>& expected,
                      const std::map<std::string, std::string>& found, const std::string& what) const;
     void expectEverySurvivingNameWasWritten(CXRolvane& database) const;

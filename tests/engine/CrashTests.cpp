@@ -155,6 +155,14 @@ protected:
         Daemon daemon(before / "daemon");
         daemon.world.cx->whenGathering = nullptr;
         daemon.world.cx->whenClosing = nullptr;
+        for (const char* person : {"P1:CXPerson", "P2:CXPerson", "P3:CXPerson", "P9:CXPerson"})
+            daemon.world.rolvane->addRecord(CXPerson::initWithUniqueId(UniqueId(person)));
+        const CXGroupRef group = CXGroup::initWithUniqueId(UniqueId(kGroup));
+        daemon.world.rolvane->addRecord(group);
+        for (const std::string& person : kPeople)
+            group->addMember(
+                std::dynamic_pointer_cast<CXPerson>(daemon.world.rolvane->recordForUniqueId(UniqueId(person))));
+        daemon.world.rolvane->save();
         daemon.pass();
         daemon.world.engine->setPendingChanges({update("P9:CXPerson")});
         daemon.world.engine->setConduitObjectForKey("CXDLocal", Dictionary{{"never", "thrown away"}}, "marker");

@@ -1,0 +1,203 @@
+#include "engine/UnderWay.h"
+
+#include "contacts/CXGroup.h"
+#include "contacts/CXRolvane.h"
+#include "contacts/Constants.h"
+#include "contacts/Identifier.h"
+#include "engine/Holdings.h"
+#include "engine/PublicationCache.h"
+#include "model/PayloadKeys.h"
+#include "model/RemoteLocationMap.h"
+
+#include <array>
+#include <string_view>
+#include <unordered_map>
+#include <unordered_set>
+
+namespace rolvane {
+
+namespace {
+
+constexpr const char* kPeople = "people";
+constexpr const char* kGroups = "groups";
+constexpr const char* kNamed = "named";
+constexpr std::array kLists{kMemberAdds, kMemberRemoves, kSubgroupAdds, kSubgroupRemoves};
+
+Dictionary knownGroups(const Dictionary& conduitData) {
+    return conduitData[kConduitVaultra].dictionary()[kPriorState].dictionary()[kSelf.str()].dictionary();
+}
+
+bool isOwnWrite(const CXDChangeRecord& record) {
+    return record.initialSource() == CXDSyncSourceCX && record.changeMadeByDataOwner() &&
+           (record.appliesToSources() & CXDSyncSourceVaultra) != 0;
+}
+
+std::string shared(const UniqueId& uid, std::string_view table) {
+    return cxUIDWithTableName(uid, table).str();
+}
+
+void addEach(Array to, const Value& elements) {
+    for (const Value& element : elements.array()) to.append(element);
+}
+
+// Where a change of one member or subgroup belongs; none for other changes.
+const char* listOf(int32_t type) {
+    switch (type) {
+    case CXDAddRecordToGroup: return kMemberAdds;
+    case CXDRemoveRecordFromGroup: return kMemberRemoves;
+    case CXDAddGroupToGroup: return kSubgroupAdds;
+    case CXDRemoveGroupFromGroup: return kSubgroupRemoves;
+    default: return nullptr;
+    }
+}
+
+void noteGroup(Dictionary& group, const CXDChangeRecord& record) {
+    const Value content = record.inMemoryPayload();
+    const Dictionary payload = content.isDictionary() ? content.dictionary() : Dictionary();
+    for (const char* list : kLists)
+        if (payload.contains(list)) addEach(group.arrayFor(list), payload[list]);
+    if (record.type() == CXDChangeGroupName || payload.contains(kCXGroupNameProperty)) group.set(kNamed, true);
+    const char* list = listOf(record.type());
+    if (!list || !record.person()) return;
+    const bool isGroup = list == kSubgroupAdds || list == kSubgroupRemoves;
+    group.arrayFor(list).append(shared(*record.person(), isGroup ? kCXGroupTable : kCXPersonTable));
+}
+
+// Makes the records of one pass's beginning.
+class Settlement {
+public:
+    Settlement(const CXDChangeRecords& records, Dictionary& conduitData, CXRolvane& rolvane)
+        : _conduitData(conduitData), _known(knownGroups(conduitData)), _rolvane(rolvane), _holdings(rolvane) {
+        for (const CXDChangeRecordPtr& record : records)
+            if (record->group() && isOwnWrite(*record)) _gathered.insert(shared(*record->group(), kCXGroupTable));
+    }
+
+    void person(const UniqueId& uid) {
+        if (_holdings.person(uid)) return;
+        add(CXDDeleteRecord, uid, std::nullopt);
+        _gone.insert(uid.str());
+    }
+
+    void group(const UniqueId& uid, const Dictionary& touched) {
+        const bool isAll = uid.str() == kCXAllGroupUID;
+        const CXGroupRef there =
+            isAll ? _rolvane.allGroup() : std::dynamic_pointer_cast<CXGroup>(_rolvane.recordForUniqueId(uid));
+        if (!_holdings.group(uid)) {
+            add(CXDDeleteGroup, std::nullopt, uid);
+            _gone.insert(uid.str());
+            return;
+        }
+        if (!there) return; // a copy of somebody else's
+        const bool isKnown = _known.contains(uid.str());
+        if (!isKnown && !_gathered.contains(uid.str())) return;
+        const Dictionary known = _known[uid.str()].dictionary();
+        std::unordered_set<std::string>& decided = _decided[uid.str()];
+        for (const char* list : kLists)
+            for (const Value& name : touched[list].array()) decided.insert(name.string());
+        set(uid, touched, known[kMemberUIDState], there->memberUniqueIds(),
+            {kMemberAdds, kMemberRemoves, CXDAddRecordToGroup, CXDRemoveRecordFromGroup, kCXPersonTable});
+        set(uid, touched, known[kSubgroupUIDState], there->subgroupUniqueIds(),
+            {kSubgroupAdds, kSubgroupRemoves, CXDAddGroupToGroup, CXDRemoveGroupFromGroup, kCXGroupTable});
+        if (!touched[kNamed].boolean()) return;
+        _renamed.insert(uid.str());
+        if (isKnown && !isAll) add(CXDChangeGroupName, std::nullopt, uid, Value(there->name()));
+    }
+
+    CXDChangeRecords take() { return std::move(_records); }
+
+    // Would it bring back, or take away, from the store what the database decides?
+    bool isOverruled(const CXDChangeRecord& record) const {
+        if (record.initialSource() != CXDSyncSourceVaultra || !record.changeMadeByDataOwner()) return false;
+        const bool isSubgroup = record.type() == CXDAddGroupToGroup || record.type() == CXDRemoveGroupFromGroup;
+        const std::string person =
+            record.person() ? shared(*record.person(), isSubgroup ? kCXGroupTable : kCXPersonTable) : std::string();
+        if (_gone.contains(person)) return true;
+        if (!record.group()) return false;
+        const std::string group = shared(*record.group(), kCXGroupTable);
+        if (_gone.contains(group)) return true;
+        if (record.type() == CXDChangeGroupName) return _renamed.contains(group);
+        const auto decided = _decided.find(group);
+        return decided != _decided.end() && decided->second.contains(person);
+    }
+
+private:
+    struct Kind {
+        const char *adds, *removes;
+        CXDChangeType add, remove;
+        std::string_view table;
+    };
+    // What is known and not there, or there and not known, is a matter of the scan, which brings the contents along.
+    void set(const UniqueId& group, const Dictionary& touched, const Value& known, const std::vector<UniqueId>& now,
+             const Kind& kind) {
+        if (!touched.contains(kind.adds) && !touched.contains(kind.removes)) return;
+        std::unordered_set<std::string> there;
+        for (const UniqueId& uid : now) there.insert(shared(uid, kind.table));
+        const Array members = known.array();
+        for (const Value& name : touched[kind.adds].array())
+            if (!there.contains(name.string()) && !members.containsString(name.string()))
+                add(kind.remove, UniqueId(name.string()), group);
+        for (const Value& name : touched[kind.removes].array())
+            if (there.contains(name.string()) && members.containsString(name.string())) {
+                const UniqueId uid(name.string());
+                const CXDChangeRecord removal(CXDSyncSourceCX, kind.remove, kSelf, uid, group);
+                didApplyChange(_conduitData, removal, CXDSyncSourceVaultra); // that may have come to its end
+                add(kind.add, uid, group);
+            }
+    }
+
+    void add(CXDChangeType type, const std::optional<UniqueId>& person, const std::optional<UniqueId>& group,
+             const Value& payload = {}) {
+        auto record = std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, type, kSelf, person, group, payload);
+        record->setAppliesToSources(CXDSyncSourceVaultra);
+        _records.push_back(std::move(record));
+    }
+
+    Dictionary& _conduitData;
+    const Dictionary _known; // by group
+    CXRolvane& _rolvane;
+    Holdings _holdings;
+    std::unordered_set<std::string> _gathered, _gone, _renamed;
+    std::unordered_map<std::string, std::unordered_set<std::string>> _decided; // by group, its members and subgroups
+    CXDChangeRecords _records;
+};
+
+} // namespace
+
+Dictionary underWay(const CXDChangeRecords& records) {
+    Dictionary all;
+    for (const CXDChangeRecordPtr& record : records) {
+        if (!isOwnWrite(*record)) continue;
+        if (record->type() == CXDUpdateRecord && record->person()) {
+            all.arrayFor(kPeople).append(shared(*record->person(), kCXPersonTable));
+        } else if (record->group() && *record->group() != kPeopleGroup && record->type() != CXDDeleteGroup) {
+            Dictionary groups = all.dictionaryFor(kGroups);
+            Dictionary group = groups.dictionaryFor(shared(*record->group(), kCXGroupTable));
+            noteGroup(group, *record);
+        }
+    }
+    return all;
+}
+
+Dictionary underWayTogether(const Dictionary& former, const Dictionary& latter) {
+    Dictionary both = Value(former).deepMutableCopy().dictionary();
+    if (latter.contains(kPeople)) addEach(both.arrayFor(kPeople), latter[kPeople]);
+    for (const auto& [uid, touched] : latter[kGroups].dictionary()) {
+        Dictionary group = both.dictionaryFor(kGroups).dictionaryFor(uid);
+        for (const char* list : kLists)
+            if (touched.dictionary().contains(list)) addEach(group.arrayFor(list), touched.dictionary()[list]);
+        if (touched.dictionary()[kNamed].boolean()) group.set(kNamed, true);
+    }
+    return both;
+}
+
+void settleUnderWay(const Dictionary& underWay, CXDChangeRecords& records, Dictionary& conduitData,
+                    CXRolvane& rolvane) {
+    Settlement settlement(records, conduitData, rolvane);
+    for (const Value& person : underWay[kPeople].array()) settlement.person(UniqueId(person.string()));
+    for (const auto& [group, touched] : underWay[kGroups].dictionary())
+        settlement.group(UniqueId(group), touched.dictionary());
+    std::erase_if(records, [&](const CXDChangeRecordPtr& record) { return settlement.isOverruled(*record); });
+    for (CXDChangeRecordPtr& record : settlement.take()) records.push_back(std::move(record));
+}
+
+} // namespace rolvane

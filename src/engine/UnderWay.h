@@ -1,0 +1,30 @@
+#pragma once
+
+#include "foundation/Value.h"
+#include "model/CXDChangeRecord.h"
+
+#include <cstddef>
+
+namespace rolvane {
+
+class CXRolvane;
+
+// What a pass is about to put on the network store of the owner's own: people, and groups with those members and
+// subgroups that are put in or taken out, or whose name is set. Nothing but the end of the pass would remember it. It
+// is put down before the workers begin; when the pass is killed and the person undoes such a change before the next
+// one, no comparison of what is known with what is there finds anything, or one finds the pass's own write, takes it
+// for somebody else's and brings it back.
+
+// {"people": array, "groups": {group: {"memberAdds": array, "memberRemoves", "subgroupAdds", "subgroupRemoves":
+// likewise, "named": true}}}; empty when there is nothing to remember.
+Dictionary underWay(const CXDChangeRecords& records);
+// Both together; neither is changed.
+Dictionary underWayTogether(const Dictionary& former, const Dictionary& latter);
+
+// What was under way when a pass was killed is made what the database says: whoever or whatever is gone is removed from
+// the store, members are put in or taken out, names are set. The records for it are added to `records`, which is what
+// the pass has gathered and the queue; and those are taken out by which the store would bring the same back. Of groups
+// only those are spoken of that are shared still, which is to say that they are known or gathered.
+void settleUnderWay(const Dictionary& underWay, CXDChangeRecords& records, Dictionary& conduitData, CXRolvane& rolvane);
+
+} // namespace rolvane
