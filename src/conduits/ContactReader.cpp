@@ -134,9 +134,10 @@ std::optional<RemoteLocation> ContactReader::locationOfGroup(const CXGroup& grou
 
 // -- group states
 
-Dictionary ContactReader::groupState(const CXGroup& group, bool withDistributionLists, const TextSharing& share) const {
+Dictionary ContactReader::groupState(const CXGroup& group, bool withDistributionLists, const Array& known,
+                                     const TextSharing& share) const {
     Dictionary state;
-    state.set(kMemberUIDState, asArray(group.memberIdentifiers(), share));
+    state.set(kMemberUIDState, asArray(group.memberIdentifiersLike(known), share));
     state.set(kSubgroupUIDState, asArray(group.subgroupIdentifiers(), {}));
     if (const std::string name = group.name(); !name.empty()) state.set(kCXGroupNameProperty, name);
     addPrincipals(state, group, kCXReadWriteSharingACLProperty);

@@ -50,7 +50,9 @@ public:
     // The same identifier, perhaps with a text that is there already.
     using TextSharing = std::function<UniqueId(const UniqueId&)>;
     // The group as it stands now: members, subgroups, name, access lists and, when asked for, distribution choices.
-    Dictionary groupState(const CXGroup& group, bool withDistributionLists, const TextSharing& share = {}) const;
+    // Members who are among the `known` ones share their texts.
+    Dictionary groupState(const CXGroup& group, bool withDistributionLists, const Array& known = {},
+                          const TextSharing& share = {}) const;
     static Dictionary distributionListState(const CXGroup& group);
     // The person's choices in one of the groups that list the person. With `many` expected, a group's choices are read
     // at once and kept; otherwise those of one person.

@@ -18,6 +18,7 @@ public:
     // Null when the shared database has no subscription to the location; the database's own for "local".
     static CXAllGroupRef allGroupForRemoteLocation(const RemoteLocation& location);
 
+    std::vector<UniqueId> memberIdentifiersLike(const Array& known) const override;
     std::vector<UniqueId> memberUniqueIds() const override;
     std::vector<UniqueId> subgroupUniqueIds() const override;
     size_t memberCount() const override;

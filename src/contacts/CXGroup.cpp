@@ -108,8 +108,8 @@ std::vector<UniqueId> CXGroup::subgroupUniqueIds() const {
     return database->impl().listed(uniqueId(), true);
 }
 
-std::vector<UniqueId> CXGroup::memberIdentifiers() const {
-    return sharing(memberUniqueIds());
+std::vector<UniqueId> CXGroup::memberIdentifiersLike(const Array& known) const {
+    return SharedForms(known).of(memberUniqueIds());
 }
 std::vector<UniqueId> CXGroup::subgroupIdentifiers() const {
     return sharing(subgroupUniqueIds());

@@ -28,7 +28,9 @@ public:
     std::vector<CXPersonRef> members() const;
     std::vector<CXGroupRef> subgroups() const;
     // In member order, one query, no objects: `sharingUniqueId`s, and `uniqueId`s.
-    std::vector<UniqueId> memberIdentifiers() const;
+    std::vector<UniqueId> memberIdentifiers() const { return memberIdentifiersLike({}); }
+    // The same; those that are also in `known`, in the same order but for changes, share the text of the string there.
+    virtual std::vector<UniqueId> memberIdentifiersLike(const Array& known) const;
     std::vector<UniqueId> subgroupIdentifiers() const;
     virtual std::vector<UniqueId> memberUniqueIds() const;
     virtual std::vector<UniqueId> subgroupUniqueIds() const;

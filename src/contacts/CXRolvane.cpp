@@ -350,9 +350,7 @@ size_t CXRolvane::countPeople(const std::optional<RemoteLocation>& location) {
     std::lock_guard lock(_impl->mutex);
     std::optional<std::string> of = location ? std::optional(location->str()) : std::nullopt;
     size_t count = 0;
-    for (RecordKind kind : {RecordKind::person, RecordKind::subscribedPerson})
-        count += _impl->work.records().empty() ? static_cast<size_t>(_impl->store.countOf(kind, of))
-                                               : _impl->recordsOf(kind, of).size();
+    for (RecordKind kind : {RecordKind::person, RecordKind::subscribedPerson}) count += _impl->countOf(kind, of);
     return count;
 }
 

@@ -72,9 +72,9 @@ void switchToWAL(Sqlite& database) {
     }
 }
 
-std::vector<std::pair<int64_t, UniqueId>> numbered(Sqlite::Statement& s) {
+std::vector<std::pair<int64_t, UniqueId>> numbered(Sqlite::Statement& s, const RecordStore::Naming& name = {}) {
     std::vector<std::pair<int64_t, UniqueId>> all;
-    while (s.step()) all.emplace_back(s.integer(0), UniqueId(s.text(1)));
+    while (s.step()) all.emplace_back(s.integer(0), name ? name(s.textView(1)) : UniqueId(s.textView(1)));
     return all;
 }
 
@@ -216,15 +216,15 @@ std::optional<UniqueId> RecordStore::firstOfLocation(RecordKind kind, std::strin
     return UniqueId(s.text(0));
 }
 
-std::vector<std::pair<int64_t, UniqueId>> RecordStore::recordsOf(RecordKind kind,
-                                                                 const std::optional<std::string>& location) {
+std::vector<std::pair<int64_t, UniqueId>>
+RecordStore::recordsOf(RecordKind kind, const std::optional<std::string>& location, const Naming& name) {
     // Read from the index alone, so that listing everybody does not walk over everybody's data.
     auto s = _database.statement(
         location ? "SELECT id, uid FROM records INDEXED BY records_location WHERE kind=?1 AND location=?2"
                  : "SELECT id, uid FROM records INDEXED BY records_location WHERE kind=?1");
     s.bind(1, static_cast<int>(kind));
     if (location) s.bind(2, std::string_view(*location));
-    auto all = numbered(s);
+    auto all = numbered(s, name);
     if (!std::is_sorted(all.begin(), all.end(), isOlder)) std::sort(all.begin(), all.end(), isOlder);
     return all;
 }

@@ -49,8 +49,11 @@ public:
     int64_t rowNumber(const UniqueId& uid); // 0 when there is none
     std::pair<int64_t, RecordKind> numberAndKind(const UniqueId& uid);
     std::optional<UniqueId> firstOfLocation(RecordKind kind, std::string_view location);
-    // With row numbers, by age.
-    std::vector<std::pair<int64_t, UniqueId>> recordsOf(RecordKind kind, const std::optional<std::string>& location);
+    // Makes an identifier of one in the database.
+    using Naming = std::function<UniqueId(std::string_view)>;
+    // With row numbers, by age. Without a naming as they stand there.
+    std::vector<std::pair<int64_t, UniqueId>> recordsOf(RecordKind kind, const std::optional<std::string>& location,
+                                                        const Naming& name = {});
     std::vector<std::pair<UniqueId, RecordKind>> listed(const UniqueId& group); // members and subgroups in list order
     bool isListed(const UniqueId& group, const UniqueId& member);
     int64_t countMembers(const UniqueId& group);

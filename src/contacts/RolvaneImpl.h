@@ -4,6 +4,7 @@
 #include "contacts/ChangeWatcher.h"
 #include "contacts/Journal.h"
 #include "contacts/RecordStore.h"
+#include "contacts/SharedForms.h"
 #include "contacts/UnitOfWork.h"
 
 #include <mutex>
@@ -58,6 +59,9 @@ struct CXRolvane::Impl {
     Date modified(const UniqueId& uid);
     std::optional<CXRow> row(const UniqueId& uid, bool withParents);
     std::vector<UniqueId> recordsOf(RecordKind kind, const std::optional<std::string>& location);
+    std::vector<UniqueId> sharedFormsOf(RecordKind people, const std::optional<std::string>& location,
+                                        SharedForms& forms);
+    size_t countOf(RecordKind kind, const std::optional<std::string>& location);
     std::vector<UniqueId> listed(const UniqueId& group, bool groups);
     bool isListed(const UniqueId& group, const UniqueId& member);
     std::vector<UniqueId> parents(const UniqueId& member);

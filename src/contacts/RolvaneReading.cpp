@@ -27,8 +27,12 @@ constexpr size_t kKeptList = 20000; // members of the group whose list is kept
 // Row numbers of records that are not saved yet come after all stored ones, in order of their addition.
 constexpr int64_t kUnsavedRow = int64_t{1} << 60;
 
+bool isOlder(const std::pair<int64_t, UniqueId>& a, const std::pair<int64_t, UniqueId>& b) {
+    return a.first < b.first;
+}
+
 std::vector<UniqueId> byAge(std::vector<std::pair<int64_t, UniqueId>> records) {
-    std::sort(records.begin(), records.end());
+    if (!std::is_sorted(records.begin(), records.end(), isOlder)) std::sort(records.begin(), records.end(), isOlder);
     std::vector<UniqueId> all;
     all.reserve(records.size());
     for (auto& [number, uid] : records) all.push_back(std::move(uid));
@@ -149,6 +153,18 @@ std::vector<UniqueId> CXRolvane::Impl::recordsOf(RecordKind wanted, const std::o
         if (number != 0) records.emplace_back(number, uid);
     }
     return byAge(std::move(records));
+}
+
+std::vector<UniqueId> CXRolvane::Impl::sharedFormsOf(RecordKind wanted, const std::optional<std::string>& location,
+                                                     SharedForms& forms) {
+    if (work.records().empty()) // they get no text of their own in between
+        return byAge(store.recordsOf(wanted, location, [&](std::string_view uid) { return forms.of(uid); }));
+    return forms.of(recordsOf(wanted, location));
+}
+
+size_t CXRolvane::Impl::countOf(RecordKind wanted, const std::optional<std::string>& location) {
+    if (work.records().empty()) return static_cast<size_t>(store.countOf(wanted, location));
+    return recordsOf(wanted, location).size();
 }
 
 const CXRolvane::Impl::StoredList& CXRolvane::Impl::storedList(const UniqueId& group) {

@@ -169,6 +169,10 @@ double Sqlite::Statement::real(int column) const {
 }
 
 std::string Sqlite::Statement::text(int column) const {
+    return std::string(textView(column));
+}
+
+std::string_view Sqlite::Statement::textView(int column) const {
     const auto* text = reinterpret_cast<const char*>(sqlite3_column_text(_prepared->statement, column));
     if (!text) return {};
     return {text, static_cast<size_t>(sqlite3_column_bytes(_prepared->statement, column))};

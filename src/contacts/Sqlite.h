@@ -48,6 +48,7 @@ public:
         int64_t integer(int column) const;
         double real(int column) const;
         std::string text(int column) const;
+        std::string_view textView(int column) const; // until the next step
         Bytes bytes(int column) const;
         bool isNull(int column) const;
 
