@@ -20,14 +20,14 @@ const char* conduitOf(int32_t source) {
     }
 }
 
-std::optional<std::string> normalisedPerson(const CXDChangeRecord& record) {
+std::optional<UniqueId> normalisedPerson(const CXDChangeRecord& record) {
     if (!record.person()) return std::nullopt;
     const bool isSubgroup = record.type() == CXDAddGroupToGroup || record.type() == CXDRemoveGroupFromGroup;
-    return cxUIDWithTableName(*record.person(), isSubgroup ? kCXGroupTable : kCXPersonTable).str();
+    return cxUIDWithTableName(*record.person(), isSubgroup ? kCXGroupTable : kCXPersonTable);
 }
 
-void appendOnce(Array list, const std::string& element) {
-    if (!list.containsString(element)) list.append(element);
+void appendOnce(Array list, const Value& element) {
+    if (!list.contains(element)) list.append(element);
 }
 
 void appendEach(Array list, const Value& elements) {
@@ -40,7 +40,7 @@ void removeEach(Array list, const Value& elements) {
     if (const Array* removed = elements.arrayIf()) list.removeAllOf(*removed);
 }
 
-void removeOne(const Value& list, const std::optional<std::string>& element) {
+void removeOne(const Value& list, const std::optional<UniqueId>& element) {
     if (const Array* elements = list.arrayIf(); elements && element) Array(*elements).removeAll(*element);
 }
 
@@ -50,7 +50,7 @@ std::optional<Dictionary> existingState(const Dictionary& users, const std::stri
     return state ? std::optional(*state) : std::nullopt;
 }
 
-void foldStructure(Dictionary& state, const CXDChangeRecord& record, const std::optional<std::string>& person) {
+void foldStructure(Dictionary& state, const CXDChangeRecord& record, const std::optional<UniqueId>& person) {
     Array members = state.arrayFor(kMemberUIDState);
     Array subgroups = state.arrayFor(kSubgroupUIDState);
     if (record.type() == CXDAddGroupToGroup) {
@@ -89,13 +89,13 @@ void foldAccessList(Dictionary& state, const CXDChangeRecord& record) {
     removeEach(principals, payload[kDeletions]);
 }
 
-void foldIntoExisting(Dictionary& state, const CXDChangeRecord& record, const std::optional<std::string>& person) {
+void foldIntoExisting(Dictionary& state, const CXDChangeRecord& record, const std::optional<UniqueId>& person) {
     switch (record.type()) {
     case CXDRemoveRecordFromGroup: removeOne(state[kMemberUIDState], person); break;
     case CXDRemoveGroupFromGroup: removeOne(state[kSubgroupUIDState], person); break;
     case CXDUpdateDistributionList: {
         Dictionary distribution = state.dictionaryFor(kDistributionListState);
-        if (const Value payload = record.inMemoryPayload(); payload && person) distribution.set(*person, payload);
+        if (const Value payload = record.inMemoryPayload(); payload && person) distribution.set(person->str(), payload);
         break;
     }
     default: foldAccessList(state, record); break;
@@ -111,7 +111,7 @@ void updateCache(Dictionary& conduitData, int32_t source, const CXDChangeRecord&
         conduitData.dictionaryFor(conduit).dictionaryFor(kPriorState).dictionaryFor(record.user()->str());
     if (!record.group()) return;
     const std::string group = cxUIDWithTableName(*record.group(), kCXGroupTable).str();
-    const std::optional<std::string> person = normalisedPerson(record);
+    const std::optional<UniqueId> person = normalisedPerson(record);
 
     switch (record.type()) {
     case CXDCreateStructureForGroup:

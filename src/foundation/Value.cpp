@@ -16,6 +16,7 @@ namespace {
 const Value kAbsent;
 constexpr size_t kIndexFrom = 24;               // below this a linear search is as fast as the index
 constexpr size_t kMostIndexed = UINT32_MAX - 2; // places have 32 bits
+constexpr size_t kAhead = 4;                    // removals whose places in the index are under way from memory
 
 } // namespace
 
@@ -44,6 +45,8 @@ public:
         for (size_t i = hash & mask(); _slots[i].place != kEmpty; i = (i + 1) & mask())
             if (_slots[i].hash == hash && _slots[i].place != kGone && call(_slots[i].place)) _slots[i].place = kGone;
     }
+    // The hash is likely to be asked for soon: its slot is fetched meanwhile.
+    void expect(uint32_t hash) const { __builtin_prefetch(&_slots[hash & mask()], 1); }
 
 private:
     struct Slot {
@@ -112,18 +115,25 @@ struct Array::Storage : SharedObject {
 
     void takeOut(const SharedText& text) {
         indexed();
-        index.load()->eraseIf(text.hash(), [&](uint32_t place) {
+        Places& places = *index.load();
+        places.eraseIf(text.hash(), [&](uint32_t place) {
             if (const SharedText* held = items[place].textIf(); !held || *held != text) return false;
             items[place] = Value();
             gaps.push_back(place);
             return true;
         });
         gapCount.store(gaps.size(), std::memory_order_release);
+        if (!gaps.empty()) expectRemoval(places, gaps.back() + kAhead);
+    }
+    // Who takes out one element after the other mostly does so in their order, and a large index is in no near cache.
+    void expectRemoval(const Places& places, size_t place) const {
+        const SharedText* next = place < items.size() ? items[place].textIf() : nullptr;
+        if (next) places.expect(next->hash());
     }
     void closeGaps() {
         const std::lock_guard guard(turns());
         if (gapCount.load(std::memory_order_relaxed) == 0) return;
-        std::sort(gaps.begin(), gaps.end());
+        if (!std::is_sorted(gaps.begin(), gaps.end())) std::sort(gaps.begin(), gaps.end());
         size_t to = gaps.front(), gap = 0;
         for (size_t from = to; from < items.size(); ++from) {
             if (gap < gaps.size() && gaps[gap] == from)
