@@ -176,6 +176,7 @@ void ApplyLoop::split() {
 // What cannot be noted is done all the same: a full disk does not keep the store out of step.
 void ApplyLoop::noteUnderWay(const Dictionary& now) {
     try {
+        claimState();
         _parts.state.setUnderWay(underWayTogether(_formerlyUnderWay, now));
     } catch (const CXException& e) {
         CXLog("applyChangeRecords: Caught %@: %@", e.name(), e.reason());

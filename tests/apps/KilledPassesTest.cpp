@@ -70,7 +70,7 @@ TEST_F(KilledSubscriber, AtAnyMomentOfAPassLosesNothingAndDoublesNothingAfterCle
 
 class KilledPublisher : public TwoPeople {
 protected:
-    KilledPublisher() : TwoPeople(60) { world.rolvane({"daemon", "stop"}); }
+    explicit KilledPublisher(size_t count = 60) : TwoPeople(count) { world.rolvane({"daemon", "stop"}); }
 
     CXGroupRef anyGroup() { return groupOf(*alice, random() % kGroups); }
     CXPersonRef anybody() { return personOf(*alice, random() % people.size()); }
@@ -123,6 +123,18 @@ protected:
             if (path.starts_with("People/")) files.insert(path.substr(path.rfind('/') + 1));
         return files;
     }
+    void expectTheStoreHoldsJustThat() {
+        expectEqual(storeView(), view(*alice), "alice's database");
+        EXPECT_EQ(filesOnTheStore().size(), people.size());
+        const Dictionary all = PropertyList::fromXML(contentsOf(world.published("AllCXGroup"))).dictionary();
+        EXPECT_EQ(all["memberUIDState"].array().count(), people.size());
+        EXPECT_EQ(all["subgroupUIDState"].array().count(), kGroups);
+        std::set<std::string> groupsThere;
+        for (const std::string& path : world.tree())
+            if (const std::string top = path.substr(0, path.find('/')); top.ends_with(":CXGroup"))
+                groupsThere.insert(top);
+        EXPECT_EQ(groupsThere.size(), kGroups);
+    }
     std::function<void()> undo, keep;
 };
 
@@ -145,15 +157,34 @@ TEST_F(KilledPublisher, LeavesNothingOnTheStoreOfWhatIsTakenBackBeforeTheNextPas
     EXPECT_GE(inTheMiddle, kKills / 2) << "the passes were faster than the kills";
 
     cleanPass();
-    expectEqual(storeView(), view(*alice), "alice's database");
-    EXPECT_EQ(filesOnTheStore().size(), people.size());
-    const Dictionary all = PropertyList::fromXML(contentsOf(world.published("AllCXGroup"))).dictionary();
-    EXPECT_EQ(all["memberUIDState"].array().count(), people.size());
-    EXPECT_EQ(all["subgroupUIDState"].array().count(), kGroups);
-    std::set<std::string> groupsThere;
-    for (const std::string& path : world.tree())
-        if (const std::string top = path.substr(0, path.find('/')); top.ends_with(":CXGroup")) groupsThere.insert(top);
-    EXPECT_EQ(groupsThere.size(), kGroups);
+    expectTheStoreHoldsJustThat();
+}
+
+class KilledFirstPublication : public KilledPublisher {
+protected:
+    KilledFirstPublication() : KilledPublisher(300) {
+        world.done({"unpublish"});
+        world.rolvane({"daemon", "stop"});
+        for (const char* key : {"CXDShareCount", "CXDLastOstrelUser"}) world.done({"defaults", "delete", key});
+        world.done({"publish", "--no-daemon"});
+    }
+};
+
+TEST_F(KilledFirstPublication, LeavesNothingOnTheStoreOfWhoIsDeletedBeforeTheNextPass) {
+    constexpr int kKills = 8, kDeleted = 12;
+    double moment = 0.03; // seconds; about when the first one begins to write
+    for (int kill = 0; kill < kKills; ++kill) {
+        const auto daemon = world.startManager({"-p"});
+        if (!daemon->wait(moment += 0.015)) daemon->kill();
+        for (int i = 0; i < kDeleted; ++i) {
+            const size_t gone = random() % people.size();
+            alice->removeRecord(personOf(*alice, gone));
+            people.erase(people.begin() + static_cast<std::ptrdiff_t>(gone));
+        }
+        alice->save();
+    }
+    cleanPass();
+    expectTheStoreHoldsJustThat();
 }
 
 } // namespace
