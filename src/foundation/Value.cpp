@@ -100,8 +100,10 @@ struct Array::Storage : SharedObject {
     const Places& indexed() {
         if (const Places* built = index.load(std::memory_order_acquire)) return *built;
         auto fresh = std::make_unique<Places>(items.size());
-        for (size_t i = 0; i < items.size(); ++i)
+        for (size_t i = 0; i < items.size(); ++i) {
+            expect(*fresh, i + kAhead);
             if (const SharedText* s = items[i].textIf()) fresh->add(s->hash(), static_cast<uint32_t>(i));
+        }
         Places* none = nullptr;
         if (index.compare_exchange_strong(none, fresh.get(), std::memory_order_acq_rel)) return *fresh.release();
         return *none;
@@ -123,12 +125,14 @@ struct Array::Storage : SharedObject {
             return true;
         });
         gapCount.store(gaps.size(), std::memory_order_release);
-        if (!gaps.empty()) expectRemoval(places, gaps.back() + kAhead);
+        if (!gaps.empty()) expect(places, gaps.back() + kAhead);
     }
-    // Who takes out one element after the other mostly does so in their order, and a large index is in no near cache.
-    void expectRemoval(const Places& places, size_t place) const {
+    // A large index is in no near cache, and who takes out one element after the other mostly does so in their order.
+    void expect(const Places& places, size_t place) const {
         const SharedText* next = place < items.size() ? items[place].textIf() : nullptr;
-        if (next) places.expect(next->hash());
+        if (!next) return;
+        places.expect(next->hash());
+        __builtin_prefetch(next->str().data());
     }
     void closeGaps() {
         const std::lock_guard guard(turns());
