@@ -4,6 +4,7 @@
 #include "support/WaitUntil.h"
 
 #include <ctime>
+#include <set>
 
 namespace rolvane::test {
 
@@ -32,9 +33,9 @@ protected:
     enum class Dates { kept, lost };
     void restore(Dates dates) {
         copyTree(backup, tree());
-        if (dates == Dates::lost)
-            for (const auto& entry : std::filesystem::recursive_directory_iterator(tree()))
-                setDate(entry.path(), static_cast<int64_t>(Clock::system().now().secondsSince1970()) + 2);
+        if (dates == Dates::kept) return;
+        newDate = std::time(nullptr) + 1; // no second in which any of it was written before
+        for (const auto& entry : std::filesystem::recursive_directory_iterator(tree())) setDate(entry.path(), newDate);
     }
     // Things that happen after the backup.
     void change() {
@@ -86,7 +87,24 @@ protected:
         const auto ours = alice.application->allGroup()->multiValueForProperty(kCXReadWriteSharingACLProperty);
         EXPECT_EQ(ours ? ours->count() : 0, expected.size()) << "in the database";
     }
-    void expectMended(const std::map<std::string, std::string>& before) {
+    // A subscriber waits for a visit of the owner's that is dated after the copy, so a copy with new dates may still
+    // be waited for: until then nothing of what the owner has written again is read.
+    void awaitVisitAfterTheCopy() {
+        EXPECT_TRUE(waitUntil([&] { return std::time(nullptr) > newDate; }, "the second after the copy's"));
+        alice.pass();
+        bob.pass();
+    }
+    // The contacts that Bob has read, each as often as he has.
+    std::multiset<std::string> readByBob() {
+        std::multiset<std::string> names;
+        for (const auto& exchange : bob.wire->exchanges())
+            if (exchange.method == "GET" && exchange.path.find("/People/") != std::string::npos)
+                names.insert(Url::percentDecode(exchange.path.substr(exchange.path.rfind('/') + 1)));
+        return names;
+    }
+    // Gives the contacts that Bob has read on the way.
+    std::set<std::string> expectMended(const std::map<std::string, std::string>& before) {
+        bob.wire->clear();
         bob.pass(); // before the owner has seen it
         expectNothingLost(before);
         for (int i = 0; i < 3; ++i) {
@@ -97,14 +115,16 @@ protected:
         expectNothingLost(before);
         expectStoreHoldsEverything();
         EXPECT_TRUE(alice.engine->getPendingChanges().empty());
-        // What was written in the second of the last pass may be read once more when that second is over.
-        const std::time_t written = std::time(nullptr);
-        EXPECT_TRUE(waitUntil([&] { return std::time(nullptr) > written + 1; }, "the second after the next"));
-        for (Participant* each : {&alice, &bob}) each->pass();
+        if (newDate != 0) awaitVisitAfterTheCopy();
+        const auto reads = readByBob();
+        const std::set<std::string> read(reads.begin(), reads.end());
+        EXPECT_EQ(reads.size(), read.size()) << "once each\n" << bob.wire->text();
         for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
         EXPECT_TRUE(bob.alert.told.empty());
+        return read;
     }
 
+    std::time_t newDate = 0; // of the copy that is there now, if it has got one
     TempDirectory place;
     const std::filesystem::path backup = place / "backup";
 };
@@ -120,7 +140,8 @@ TEST_F(StoreLoss, AnOlderCopyOfTheTreeTakesNothingFromAnybodyAndTheOwnersDaemonM
         editOfBobs();
         const auto before = alice.view();
         restore(dates);
-        expectMended(before);
+        // The owner's text has taken the place of his own; all else is to the byte what he has read before.
+        EXPECT_EQ(expectMended(before), std::set<std::string>{people[1]->uniqueId().str()});
         people[1]->setValue(Value("Ben"), kCXFirstNameProperty);
         alice.application->save();
         settle();
