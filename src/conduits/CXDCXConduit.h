@@ -83,6 +83,7 @@ public:
 
     // A person or group that was put into a group is looked for: its content may not have come.
     bool holds(const CXDChangeRecord& record) override;
+    bool swallows(const CXDChangeRecord& record) const override; // by the kill switch
 
     void open() override;
     // Saves the database, forgets revoked users, moves the last-sync date to now and, after a full scan, the journal's

@@ -117,6 +117,10 @@ bool CXDCXConduit::hasUncapturedEdit(const UniqueId& uid) {
     return _uncaptured.contains(uid);
 }
 
+bool CXDCXConduit::swallows(const CXDChangeRecord& record) const {
+    return _readOnlyKillSwitch && record.user() == kSelf && record.initialSource() != CXDSyncSourceCX;
+}
+
 bool CXDCXConduit::holds(const CXDChangeRecord& record) {
     const bool addsPerson = record.type() == CXDAddRecordToGroup;
     if (!addsPerson && record.type() != CXDAddGroupToGroup) return true;

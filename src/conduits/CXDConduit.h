@@ -76,6 +76,10 @@ public:
     // yes.
     virtual bool holds(const CXDChangeRecord& record);
 
+    // Will this source call the record done without doing anything, because nobody has the right to such a change?
+    // Base: no.
+    virtual bool swallows(const CXDChangeRecord& /*record*/) const { return false; }
+
     // The source has refused the record, or it was given up with one that was refused: what the source holds instead
     // counts as not seen yet, so that the next comparison offers it. Base: nothing.
     virtual void wasRefused(const CXDChangeRecord& /*record*/) {}

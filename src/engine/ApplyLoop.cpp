@@ -149,8 +149,19 @@ void ApplyLoop::applyAll(bool trickle) {
     applyInOrder();
 }
 
+// What the contact database swallows changes nothing, so it contradicts nothing: the owner's own change would be given
+// up for it, in this pass and in every following one.
+CXDChangeRecords ApplyLoop::accepted() {
+    CXDChangeRecords swallowed, others;
+    for (const CXDChangeRecordPtr& record : _unhandled)
+        (_parts.conduits.cx->swallows(*record) ? swallowed : others).push_back(record);
+    CXDChangeRecords all = mingled(others);
+    append(all, mingled(swallowed));
+    return all;
+}
+
 void ApplyLoop::queue() {
-    CXDChangeRecords accepted = mingled(_unhandled);
+    CXDChangeRecords accepted = this->accepted();
     CXDLog("Mingled: %@", accepted);
     std::unordered_set<UniqueId> lossy;
     CXDChangeRecords flat = flattenGroupChanges(accepted, &lossy);
@@ -251,8 +262,26 @@ void ApplyLoop::applyInOrder(const CXDChangeRecordPtr& record) {
 bool ApplyLoop::applyTo(CXDConduit& conduit, int32_t source, const CXDChangeRecordPtr& record) {
     if (!conduit.applyChangeRecordIfNeeded(record, &_denied)) return false;
     if (!conduit.holds(*record)) return true; // done with, but not remembered: the next comparison offers it again
+    if (conduit.swallows(*record)) noteSwallowed(*record);
     _parts.state.withConduitData([&](Dictionary& data) { didApplyChange(data, *record, source); });
     return true;
+}
+
+// What is remembered of the group then is what the store holds, and not what the database does. The next scan compares
+// the two and gives the store the owner's. A group that the database does not have stays there.
+void ApplyLoop::noteSwallowed(const CXDChangeRecord& record) {
+    switch (record.type()) {
+    case CXDAddRecordToGroup:
+    case CXDAddGroupToGroup:
+    case CXDRemoveRecordFromGroup:
+    case CXDRemoveGroupFromGroup:
+    case CXDChangeGroupName:
+    case CXDUpdateDistributionList: break;
+    default: return;
+    }
+    if (!record.group()) return;
+    if (_parts.with.rolvane.recordForUniqueId(cxUIDWithTableName(*record.group(), kCXGroupTable)))
+        _unsettled.set(record.group()->str(), true);
 }
 
 // The list stays the same for the whole pass, so one walk a user is enough.

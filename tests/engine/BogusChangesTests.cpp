@@ -1,0 +1,74 @@
+// A store that says what nobody but the owner may write, where nobody else has the right to write.
+
+#include "TwoUsers.h"
+#include "model/PayloadKeys.h"
+
+namespace rolvane::test {
+
+class BogusChanges : public TwoUsers {
+protected:
+    BogusChanges() {
+        for (const char* list : {kCXReadSharingACLProperty, kCXReadWriteSharingACLProperty})
+            alice.application->allGroup()->removeValueForProperty(list);
+        alice.application->save();
+        alice.start(); // the list of writers is looked at once
+        settle();
+    }
+    void settle() {
+        for (int i = 0; i < 3; ++i) alice.pass();
+    }
+    std::filesystem::path stateOf(const CXGroupRef& group) {
+        const std::filesystem::path file = world->file(group->uniqueId().str());
+        return std::filesystem::is_directory(file) ? file / CXDAVManager::kStateName : file;
+    }
+    std::set<std::string> membersOnTheStore(const CXGroupRef& group) {
+        std::set<std::string> members;
+        for (const Value& member : contentOf(stateOf(group))[kMemberUIDState].array()) members.insert(member.string());
+        return members;
+    }
+    void putOnTheStore(const CXGroupRef& group, const std::vector<UniqueId>& members) {
+        Dictionary state = contentOf(stateOf(group)).mutableCopy();
+        Array listed;
+        for (const UniqueId& member : members) listed.append(member.str());
+        state.set(kMemberUIDState, listed);
+        rewrite(stateOf(group), PropertyList::toXML(state));
+    }
+};
+
+TEST_F(BogusChanges, ADeletionIsNotGivenUpForAnotherVersionOnTheStore) {
+    writeElsewhere(people[1], "Mallory");
+    alice.application->removeRecord(people[1]);
+    alice.application->save();
+    settle();
+    EXPECT_FALSE(std::filesystem::exists(fileOf(people[1]))) << log.text();
+    EXPECT_EQ(alice.countPeople(), 2u);
+}
+
+TEST_F(BogusChanges, AGroupIsDeletedThoughTheStoreSaysSomethingElseOfIt) {
+    putOnTheStore(friends, {people[1]->uniqueId()});
+    alice.application->removeRecord(friends);
+    alice.application->save();
+    settle();
+    EXPECT_FALSE(std::filesystem::exists(world->file(friends->uniqueId().str()))) << log.text();
+}
+
+TEST_F(BogusChanges, AGroupOnTheStoreBecomesWhatTheOwnerHas) {
+    const std::set<std::string> before = membersOnTheStore(friends);
+    ASSERT_EQ(before, (std::set{people[0]->uniqueId().str(), people[2]->uniqueId().str()}));
+    putOnTheStore(friends, {people[0]->uniqueId(), people[1]->uniqueId()});
+    settle();
+    EXPECT_EQ(membersOnTheStore(friends), before) << log.text();
+    EXPECT_EQ(friends->memberUniqueIds().size(), 2u);
+    expectQuietPass(alice);
+}
+
+TEST_F(BogusChanges, WhatTheDatabaseDoesNotHaveIsLeftWhereItIs) {
+    const CXGroupRef strange = CXGroup::create();
+    rewrite(world->file(strange->uniqueId().str()),
+            PropertyList::toXML(Dictionary{{kCXGroupNameProperty, "Strange"}, {kMemberUIDState, Array()}}));
+    settle();
+    EXPECT_TRUE(std::filesystem::exists(world->file(strange->uniqueId().str()))) << log.text();
+    EXPECT_EQ(alice.application->recordForUniqueId(strange->uniqueId()), nullptr);
+}
+
+} // namespace rolvane::test
