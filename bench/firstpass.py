@@ -18,8 +18,9 @@ CONTACT = re.compile(r"/People/\d+/.")
 CONNECTIONS, STREAMS = 10, 100  # over HTTP/1.1, and on the one connection over HTTP/2
 NEAR_AIM, FAR_AIM, NOTHING_AIM = 0.5, 0.9, 3.0
 MEMORY_LIMIT, MEMORY_PEOPLE = 300, 50000
-RCLONE_FILES = 200
-ROUNDS = {1000: 3, 10000: 2}  # on loopback; otherwise 1. Everybody's fastest counts.
+RCLONE_FILES, PEER_FILES = 200, 10000  # so many tell a client's rate, however many more the tree holds
+ROUNDS = {1000: 3}  # on loopback; otherwise 1. Everybody's fastest counts.
+RCLONE_ROUNDS = {10000: 3}  # of the comparison with nothing new; otherwise 1
 
 Entry = collections.namedtuple("Entry", "time user method status bytes path")
 
@@ -135,6 +136,7 @@ class Tree:
     def __init__(self, store, user, count, root):
         self.store, self.user, self.count, self.root = store, user, count, root
         self.names = [name for name, _, _ in sorted(store.files(user))]
+        self.read = self.names[::-(-count // PEER_FILES)]  # from all buckets
         self.login = f"{user}:{PASSWORD}"
 
     def url(self, port):
@@ -149,26 +151,27 @@ class Tree:
     def raw(self, port, protocol):
         """h2load. Each of its connections asks for the same files, from the first one on. The rate is its own, from
         the first connection to the last answer."""
-        urls = self._script("h2load.urls", "".join(f"{self.url(port)}/{name}\n" for name in self.names))
+        count = len(self.read)
+        urls = self._script("h2load.urls", "".join(f"{self.url(port)}/{name}\n" for name in self.read))
         key = base64.b64encode(self.login.encode()).decode()
         width = ["--h1", "-c", str(CONNECTIONS)] if protocol == "h1" else ["-c", "1", "-m", str(STREAMS)]
-        result, said = measured(self.store, self.user, ["h2load", "-n", str(self.count), "-i", urls, "-H",
-                                                        f"authorization: Basic {key}", *width], self.count)
+        result, said = measured(self.store, self.user, ["h2load", "-n", str(count), "-i", urls, "-H",
+                                                        f"authorization: Basic {key}", *width], count)
         os.unlink(urls)
         rate = re.search(r"finished in [^,]*, ([0-9.]+) req/s", said)
-        if not rate or f"{self.count} succeeded" not in said:
+        if not rate or f"{count} succeeded" not in said:
             raise Failure(f"h2load did not get everything: {said[-600:]}")
-        result["wall"] = self.count / float(rate[1])
+        result["wall"] = count / float(rate[1])
         return result
 
     def curl(self, port, protocol):
         text = f'user = "{self.login}"\nbasic\ncacert = "{self.store.authority}"\n'
-        text += "".join(f'url = "{self.url(port)}/{name}"\noutput = "/dev/null"\n' for name in self.names)
+        text += "".join(f'url = "{self.url(port)}/{name}"\noutput = "/dev/null"\n' for name in self.read)
         script = self._script("curl.conf", text)
         width = ["--http1.1", "--parallel-max", str(CONNECTIONS)] if protocol == "h1" else \
             ["--http2", "--parallel-max", str(STREAMS)]
         result, _ = measured(self.store, self.user, ["curl", "--silent", "--show-error", "--fail", "--globoff",
-                                                     "--parallel", *width, "--config", script], self.count)
+                                                     "--parallel", *width, "--config", script], len(self.read))
         os.unlink(script)
         return result
 
@@ -206,6 +209,7 @@ class Subscription:
     """The part "subscription" of the benchmarks."""
 
     SIZES, QUICK_SIZES = (1000, 10000, 50000), (1000, 10000)
+    FAR = {1000: "h1", 10000: "h2"}
 
     def __init__(self, bench, quick):
         self.bench, self.quick, self.store = bench, quick, bench.store
@@ -217,14 +221,12 @@ class Subscription:
         for count in sizes:
             publisher = self.bench.publisher(count, 10)
             publisher.publish()
-            self.invite(publisher, 2 * self.rounds(count) + 2)
+            self.invite(publisher, 2 * self.rounds(count) + (2 if count in self.FAR else 0))
             publisher.run("daemon", "stop")  # it would look at the tree from time to time
             tree = Tree(self.store, publisher.name, count, self.bench.root)
             self.near(tree)
-            if count == 1000:
-                self.far(tree, "h1")
-            if count == 10000:
-                self.far(tree, "h2")
+            if count in self.FAR:
+                self.far(tree, self.FAR[count])
             self.bench.dismiss(publisher)
         return self.results
 
@@ -323,7 +325,7 @@ class Subscription:
                 "wall": statistics.median(run["wall"] for run in runs),
                 "cpu": statistics.mean(run["cpu"] for run in runs),
                 "server_cpu": statistics.mean(run["server_cpu"] for run in runs)}
-        theirs = tree.rclone_nothing(3)
+        theirs = tree.rclone_nothing(RCLONE_ROUNDS.get(tree.count, 1))
         for name, row in (("ours", ours), ("rclone sync", theirs)):
             print(f"    nothing new, {name:>11}: {row['wall']:.3f} s, client {row['cpu']:.3f} s and server "
                   f"{row['server_cpu']:.3f} s of CPU, {row['bytes']} bytes, {json.dumps(row['requests'])}", flush=True)
