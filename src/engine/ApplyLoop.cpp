@@ -261,15 +261,17 @@ void ApplyLoop::applyInOrder(const CXDChangeRecordPtr& record) {
 
 bool ApplyLoop::applyTo(CXDConduit& conduit, int32_t source, const CXDChangeRecordPtr& record) {
     if (!conduit.applyChangeRecordIfNeeded(record, &_denied)) return false;
-    if (!conduit.holds(*record)) return true; // done with, but not remembered: the next comparison offers it again
-    if (conduit.swallows(*record)) noteSwallowed(*record);
+    const bool ofOwnGroup = conduit.swallows(*record) && noteSwallowed(*record);
+    // Done with, but not remembered: the next comparison offers it again.
+    if (!ofOwnGroup && !conduit.holds(*record)) return true;
     _parts.state.withConduitData([&](Dictionary& data) { didApplyChange(data, *record, source); });
     return true;
 }
 
-// What is remembered of the group then is what the store holds, and not what the database does. The next scan compares
-// the two and gives the store the owner's. A group that the database does not have stays there.
-void ApplyLoop::noteSwallowed(const CXDChangeRecord& record) {
+// What is remembered of an own group then is what the store holds, a name without a contact included, and not what the
+// database does. The next scan compares the two and gives the store the owner's. False of anything else: nobody knows
+// whether the database ever had what it does not have, so that stays on the store.
+bool ApplyLoop::noteSwallowed(const CXDChangeRecord& record) {
     switch (record.type()) {
     case CXDAddRecordToGroup:
     case CXDAddGroupToGroup:
@@ -277,11 +279,12 @@ void ApplyLoop::noteSwallowed(const CXDChangeRecord& record) {
     case CXDRemoveGroupFromGroup:
     case CXDChangeGroupName:
     case CXDUpdateDistributionList: break;
-    default: return;
+    default: return false;
     }
-    if (!record.group()) return;
-    if (_parts.with.rolvane.recordForUniqueId(cxUIDWithTableName(*record.group(), kCXGroupTable)))
-        _unsettled.set(record.group()->str(), true);
+    if (!record.group() || record.group()->str() == kCXAllGroupUID) return false;
+    if (!_parts.with.rolvane.recordForUniqueId(cxUIDWithTableName(*record.group(), kCXGroupTable))) return false;
+    _unsettled.set(record.group()->str(), true);
+    return true;
 }
 
 // The list stays the same for the whole pass, so one walk a user is enough.

@@ -39,7 +39,7 @@ private:
     void applyAll(bool trickle);
     void queue(); // _unhandled becomes the flat list
     CXDChangeRecords accepted();
-    void noteSwallowed(const CXDChangeRecord& record);
+    bool noteSwallowed(const CXDChangeRecord& record);
     void split();
     void noteUnderWay(const Dictionary& now);
     void applyOutOfOrder();

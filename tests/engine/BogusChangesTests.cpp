@@ -62,6 +62,15 @@ TEST_F(BogusChanges, AGroupOnTheStoreBecomesWhatTheOwnerHas) {
     expectQuietPass(alice);
 }
 
+TEST_F(BogusChanges, ANameWithoutAContactLeavesTheGroupOnTheStore) {
+    const std::set<std::string> before = membersOnTheStore(friends);
+    putOnTheStore(friends, {people[0]->uniqueId(), people[2]->uniqueId(),
+                            UniqueId("6AD1F1B4-2D0C-4F9B-8E63-0A8B5C1D2E3F:CXPerson")});
+    settle();
+    EXPECT_EQ(membersOnTheStore(friends), before) << log.text();
+    expectQuietPass(alice);
+}
+
 TEST_F(BogusChanges, WhatTheDatabaseDoesNotHaveIsLeftWhereItIs) {
     const CXGroupRef strange = CXGroup::create();
     rewrite(world->file(strange->uniqueId().str()),
