@@ -1,6 +1,7 @@
 #include "server/StoreProcess.h"
 
 #include "foundation/CXException.h"
+#include "foundation/Paths.h"
 
 #include <algorithm>
 #include <array>
@@ -10,9 +11,7 @@
 #include <cstring>
 #include <fcntl.h>
 #include <filesystem>
-#include <fstream>
 #include <grp.h>
-#include <iterator>
 #include <linux/capability.h>
 #include <poll.h>
 #include <pwd.h>
@@ -79,10 +78,13 @@ FileHandle pidHandle(pid_t pid) {
     return FileHandle(static_cast<int>(syscall(SYS_pidfd_open, pid, 0)));
 }
 
+// Empty of a process that is gone; it may go while it is read.
 std::string commandLine(pid_t pid) {
-    std::ifstream file("/proc/" + std::to_string(pid) + "/cmdline", std::ios::binary);
-    std::string text(std::istreambuf_iterator<char>(file), {});
-    return text;
+    try {
+        return readFile("/proc/" + std::to_string(pid) + "/cmdline");
+    } catch (const CXException&) {
+        return {};
+    }
 }
 
 } // namespace

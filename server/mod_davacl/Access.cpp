@@ -3,7 +3,7 @@
 #include "server/mod_davacl/GroupFile.h"
 
 #include <fstream>
-#include <iterator>
+#include <sstream>
 
 namespace rolvane::davacl {
 namespace {
@@ -36,8 +36,10 @@ bool isGranted(request_rec* r, const Configuration& c, const TreePath& place, co
 } // namespace
 
 std::string fileText(const char* path) {
-    std::ifstream file(path, std::ios::binary);
-    return std::string(std::istreambuf_iterator<char>(file), {});
+    const std::ifstream file(path, std::ios::binary);
+    std::ostringstream text;
+    text << file.rdbuf(); // what cannot be read, a directory for instance, is empty
+    return text.str();
 }
 
 RequestState& stateOf(request_rec* r) {

@@ -1,6 +1,7 @@
 #include "engine/GoneThings.h"
 
 #include "engine/Holdings.h"
+#include "model/PayloadKeys.h"
 
 namespace rolvane {
 
@@ -25,10 +26,28 @@ CXDChangeRecordPtr removal(const CXDChangeRecord& of, CXDChangeType type, const 
     return record;
 }
 
+// Who was to be put into a group and is gone, with what puts that right: their file may have been written before.
+void withdrawMembers(const CXDChangeRecord& composite, Holdings& holdings, CXDChangeRecords& removals) {
+    const Value content = composite.inMemoryPayload();
+    if (!content.isDictionary()) return;
+    const Dictionary payload = content.dictionary();
+    for (const Value& name : payload[kMemberAdds].array())
+        if (const UniqueId person(name.string()); !holdings.person(person)) {
+            removals.push_back(removal(composite, CXDRemoveRecordFromGroup, person, composite.group()));
+            removals.push_back(removal(composite, CXDDeleteRecord, person, std::nullopt));
+        }
+    for (const Value& name : payload[kSubgroupAdds].array())
+        if (const UniqueId group(name.string()); !holdings.group(group)) {
+            removals.push_back(removal(composite, CXDRemoveGroupFromGroup, group, composite.group()));
+            removals.push_back(removal(composite, CXDDeleteGroup, std::nullopt, group));
+        }
+}
+
 } // namespace
 
 void withdrawWhatIsGone(CXDChangeRecords& records, size_t fresh, CXRolvane& rolvane) {
     Holdings holdings(rolvane);
+    CXDChangeRecords removals;
     for (size_t i = fresh; i < records.size(); ++i) {
         const CXDChangeRecord& record = *records[i];
         if (record.initialSource() != CXDSyncSourceCX || !record.changeMadeByDataOwner()) continue;
@@ -36,7 +55,10 @@ void withdrawWhatIsGone(CXDChangeRecords& records, size_t fresh, CXRolvane& rolv
             records[i] = removal(record, CXDDeleteRecord, record.person(), std::nullopt);
         else if (putsGroupThere(record) && !holdings.group(*record.group()))
             records[i] = removal(record, CXDDeleteGroup, std::nullopt, record.group());
+        else if (record.type() == CXDCompositeGroupChange && record.group())
+            withdrawMembers(record, holdings, removals);
     }
+    for (CXDChangeRecordPtr& record : removals) records.push_back(std::move(record));
 }
 
 } // namespace rolvane

@@ -122,6 +122,31 @@ TEST_F(Pass, WhatWaitedAndIsGoneFromTheDatabaseIsWithdrawn) {
                                                    "Fresh:CXPerson 1"}));
 }
 
+TEST_F(Pass, WhoWaitedToBeListedAndIsGoneFromTheDatabaseIsTakenOutAndRemoved) {
+    const CXPersonRef kept = CXPerson::initWithUniqueId(UniqueId("Kept:CXPerson"));
+    world.rolvane->addRecord(kept);
+    world.rolvane->save();
+    const Dictionary list{{"memberAdds", Array{"Kept:CXPerson", "Gone:CXPerson"}},
+                          {"subgroupAdds", Array{"Gone:CXGroup"}}};
+    world.engine->setPendingChanges({makeRecord(CXDCompositeGroupChange, nullptr, "AllCXGroup",
+                                                {CXDSyncSourceCX, CXDSyncSourceVaultra, "<self>"}, list)});
+    std::mutex lock;
+    std::multiset<std::string> applied;
+    Dictionary written;
+    world.vaultra->whenApplying = [&](const CXDChangeRecordPtr& r, bool*) {
+        const std::lock_guard guard(lock);
+        applied.insert((r->person() ? r->person()->str() : r->group()->str()) + " " + std::to_string(r->type()));
+        if (r->type() == CXDCompositeGroupChange) written = r->inMemoryPayload().deepMutableCopy().dictionary();
+        return true;
+    };
+    trickle({update("Fresh:CXPerson")});
+    EXPECT_EQ(applied, (std::multiset<std::string>{"AllCXGroup 3", "Gone:CXPerson 260", "Gone:CXGroup 261",
+                                                   "Fresh:CXPerson 1"}));
+    EXPECT_TRUE(written["memberRemoves"].array().containsString("Gone:CXPerson"));
+    EXPECT_TRUE(written["subgroupRemoves"].array().containsString("Gone:CXGroup"));
+    EXPECT_FALSE(written["memberRemoves"].array().containsString("Kept:CXPerson"));
+}
+
 TEST_F(Pass, SortsByTypeAndKeepsTheOrderOfArrivalWithinOne) {
     world.account.threads = 1;
     trickle({makeRecord(CXDDeleteRecord, "P1", nullptr), update("P2"), update("P3")});
