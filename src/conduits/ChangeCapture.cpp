@@ -136,7 +136,7 @@ void ChangeCapture::addGroup(const CXGroupRef& group) {
     if (!isNew) return;
     const UniqueId guid = cxUIDWithTableName(group->sharingUniqueId(), kCXGroupTable);
     const Dictionary priorOfUser = _priorState.dictionaryFor(destination(*location).user.str());
-    const Value prior = priorOfUser[guid.str()];
+    const Value& prior = priorOfUser[guid.str()];
     // The all-contacts group's distribution lists are never compared, so they are not read.
     const Dictionary current =
         _reader.groupState(*group, guid.str() != kCXAllGroupUID, prior.dictionary()[kMemberUIDState].array(),
