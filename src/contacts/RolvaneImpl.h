@@ -29,12 +29,12 @@ struct CXRolvane::Impl {
     std::string identity;
     std::shared_ptr<CXRolvane* const> anchor; // handles hold it weakly
     bool delivering = false;
-    // Up to this position, what is dated later was captured by a scan, though the cursor could not pass it.
+    // Up to the position, what is dated later was captured by a scan, though the cursor could not pass it.
     struct Scanned {
         int64_t position;
         Date since;
     };
-    std::optional<Scanned> scanned;
+    std::vector<Scanned> scans; // ahead of the cursor
     std::unique_ptr<ChangeWatcher> watcher;
 
     // CXException when the path names another file by now: what is read is of the past, what is saved would be lost.

@@ -3,6 +3,7 @@
 #include "contacts/RolvaneImpl.h"
 #include "contacts/ShareCountBump.h"
 
+#include <algorithm>
 #include <unistd.h>
 
 namespace rolvane {
@@ -72,10 +73,12 @@ bool CXRolvane::deliverExternalChanges() {
     if (end <= from) return false;
     std::vector<CXJournalEntry> entries = _impl->journal.foreignEntries(from, end, _impl->options.program);
     const size_t foreign = entries.size();
-    if (const auto& scanned = _impl->scanned)
-        std::erase_if(entries, [&](const CXJournalEntry& entry) {
-            return entry.sequence <= scanned->position && entry.date > scanned->since;
+    std::erase_if(_impl->scans, [&](const Impl::Scanned& scan) { return scan.position <= from; });
+    std::erase_if(entries, [&](const CXJournalEntry& entry) {
+        return std::any_of(_impl->scans.begin(), _impl->scans.end(), [&](const Impl::Scanned& scan) {
+            return entry.sequence <= scan.position && entry.date > scan.since;
         });
+    });
     if (entries.empty()) {
         if (foreign > 0 || end - from > kOwnEntriesKept) _impl->journal.setCursor(_impl->options.program, end);
         return false;
@@ -125,7 +128,9 @@ void CXRolvane::advanceCursorTo(int64_t position, Date scannedSince) {
         _impl->journal.firstForeignNotAfter(from, position, _impl->options.program, scannedSince);
     int64_t to = missed ? *missed - 1 : position;
     if (to > from) _impl->journal.setCursor(_impl->options.program, to);
-    _impl->scanned = missed ? std::optional(Impl::Scanned{position, scannedSince}) : std::nullopt;
+    // Several scans may come before the journal is read again, each with entries of its own that it has captured.
+    std::erase_if(_impl->scans, [&](const Impl::Scanned& scan) { return scan.position <= to; });
+    if (missed) _impl->scans.push_back({position, scannedSince});
 }
 
 std::vector<UniqueId> CXRolvane::changedByOthers(int64_t after, int64_t until) {

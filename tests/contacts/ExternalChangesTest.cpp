@@ -240,6 +240,24 @@ TEST(ExternalChanges, WhatAFullScanCouldNotSeeIsDeliveredAllTheSame) {
     EXPECT_FALSE(d.heard[0].contains(kCXUpdatedRecords));
 }
 
+TEST(ExternalChanges, OfSeveralScansInARowNoneIsForgotten) {
+    Watching d;
+    auto app = d.application();
+    std::vector<Date> lastSync;
+    for (const char* uid : {"During:CXPerson", "First:CXPerson", "Second:CXPerson"}) {
+        TestDatabase::addPersonTo(*app, uid, uid);
+        app->save();
+        if (!lastSync.empty()) d->advanceCursorTo(d->journalPosition(), lastSync.back()); // by a scan since then
+        d.clock.advance(1);
+        lastSync.push_back(d.clock.now());
+        d.clock.advance(1);
+    }
+    EXPECT_TRUE(d->deliverExternalChanges());
+    ASSERT_EQ(d.heard.size(), 1u);
+    EXPECT_EQ(d.list(d.heard[0], kCXInsertedRecords), (Strings{"During:CXPerson"})) << "no scan has taken this one";
+    EXPECT_FALSE(d->deliverExternalChanges());
+}
+
 TEST(ExternalChanges, TheCursorNeverMovesBackwards) {
     Watching d;
     auto app = d.application();
