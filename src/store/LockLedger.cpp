@@ -10,6 +10,7 @@
 #include <filesystem>
 #include <map>
 #include <mutex>
+#include <sstream>
 #include <unistd.h>
 
 namespace rolvane {
@@ -33,14 +34,20 @@ std::string LockLedger::pathFor(const std::string& url) const {
 
 namespace {
 
-// When the process was started, in the kernel's ticks (field 22 of its stat file); "" when there is no such process.
-// Together with the id it names a process for good.
+// When the process was started, in the kernel's ticks; "" when there is none, or only what a parent has not yet waited
+// for. Together with the id it names a process for good.
 std::string startOfProcess(const std::string& pid) {
+    constexpr unsigned kExiting = 0x4; // PF_EXITING of the field "flags": it runs no more of its own code
     try {
         const std::string text = readFile("/proc/" + pid + "/stat", 65536);
-        size_t at = text.rfind(')');
-        for (int field = 2; at != std::string::npos && field < 22; ++field) at = text.find(' ', at + 1);
-        return at == std::string::npos ? "" : text.substr(at + 1, text.find(' ', at + 1) - at - 1);
+        std::istringstream fields(text.substr(text.rfind(')') + 1));
+        std::string state, field, start;
+        unsigned flags = 0;
+        fields >> state; // field 3
+        for (int number = 4; number <= 8; ++number) fields >> field;
+        fields >> flags; // field 9
+        for (int number = 10; number <= 22; ++number) fields >> start;
+        return !fields || state == "Z" || state == "X" || (flags & kExiting) != 0 ? "" : start;
     } catch (const CXException&) {
         return {};
     }

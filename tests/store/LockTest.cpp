@@ -6,9 +6,11 @@
 
 #include <chrono>
 #include <filesystem>
+#include <fstream>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <set>
+#include <sstream>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -16,6 +18,8 @@ namespace rolvane {
 namespace {
 
 using namespace test;
+
+constexpr char kEndedRun[] = "4194305 0"; // above the highest process id that there can be (2^22)
 
 class Locks : public testing::Test {
 protected:
@@ -92,7 +96,7 @@ TEST_F(Locks, ALockOfARunThatWasKilledIsTakenOverAndOnesOfLivingRunsAreNot) {
     std::filesystem::path note;
     for (const auto& e : std::filesystem::directory_iterator(stateDirectory() + "/locks")) note = e.path();
     std::string text = readFile(note);
-    writeFileDurably(note, "1 0" + text.substr(text.find('\n')));
+    writeFileDurably(note, std::string(kEndedRun) + text.substr(text.find('\n')));
     auto next = lock(second);
     EXPECT_TRUE(next->tryLock());
     EXPECT_EQ(second.write("dateFile", "why"), 204);
@@ -107,29 +111,40 @@ TEST_F(Locks, ALockOfARunThatWasKilledBeforeItHeardOfItIsTakenOver) {
     alice.wire->clear();
     EXPECT_FALSE(lock(second)->tryLock()) << "its run is this process";
     for (const auto& run : std::filesystem::directory_iterator(stateDirectory() + "/locks-runs"))
-        writeFileDurably(run.path(), "1 0");
+        writeFileDurably(run.path(), kEndedRun);
     auto next = lock(second);
     EXPECT_TRUE(next->tryLock());
     EXPECT_EQ(second.write("dateFile", "why"), 204);
     next->unlock();
 }
 
-// What it leaves on the disk when it is killed with the lock in its hands, or before it hears of the token.
-void killRunsOfThisProcess(bool knewItsToken) {
+// As if another process had made them.
+void giveLocksOfThisProcessTo(const std::string& process, bool knowsItsTokens = true) {
     for (const auto& run : std::filesystem::directory_iterator(stateDirectory() + "/locks-runs"))
-        writeFileDurably(run.path(), "1 0");
+        writeFileDurably(run.path(), process);
     for (const auto& note : std::filesystem::directory_iterator(stateDirectory() + "/locks")) {
         std::string text = readFile(note.path());
-        text.replace(0, text.find('\n'), "1 0");
-        if (!knewItsToken) text.replace(text.rfind('\n', text.size() - 2), std::string::npos, "\n\n");
+        text.replace(0, text.find('\n'), process);
+        if (!knowsItsTokens) text.replace(text.rfind('\n', text.size() - 2), std::string::npos, "\n\n");
         writeFileDurably(note.path(), text);
     }
+}
+
+// The process id and when it was started, in the kernel's ticks; "" when there is no such process.
+std::string processLine(pid_t pid) {
+    std::ifstream stat("/proc/" + std::to_string(pid) + "/stat");
+    const std::string text((std::istreambuf_iterator<char>(stat)), {});
+    if (text.empty()) return {};
+    std::istringstream fields(text.substr(text.rfind(')') + 2)); // from field 3 on
+    std::string field;
+    for (int i = 3; i <= 22; ++i) fields >> field;
+    return std::to_string(pid) + " " + field;
 }
 
 TEST_F(Locks, WhatKilledRunsHoldIsGivenBackWhetherTheyKnewTheirTokenOrNot) {
     for (const bool knewItsToken : {true, false}) {
         ASSERT_TRUE(lock(alice)->tryLock());
-        killRunsOfThisProcess(knewItsToken);
+        giveLocksOfThisProcessTo(kEndedRun, knewItsToken);
         EXPECT_EQ(second.write("dateFile", "who"), 423);
         releaseLocksOfEndedRuns(second.manager);
         EXPECT_EQ(second.write("dateFile", "who"), 204) << second.wire->text();
@@ -138,6 +153,21 @@ TEST_F(Locks, WhatKilledRunsHoldIsGivenBackWhetherTheyKnewTheirTokenOrNot) {
         releaseLocksOfEndedRuns(second.manager);
         EXPECT_EQ(second.wire->methods(), "") << "nothing is known of any more";
     }
+}
+
+// The kernel's tables still name it, and nobody knows for how long: that is up to its parent.
+TEST_F(Locks, AKilledRunThatItsParentHasNotWaitedForHoldsNothingAnyMore) {
+    ChildProcess run(std::vector<std::string>{"sleep", "60"});
+    ASSERT_TRUE(lock(alice)->tryLock());
+    giveLocksOfThisProcessTo(processLine(run.pid()));
+    releaseLocksOfEndedRuns(second.manager);
+    EXPECT_EQ(second.write("dateFile", "who"), 423) << "it lives";
+    run.signal(SIGKILL);
+    siginfo_t ended{};
+    ASSERT_EQ(::waitid(P_PID, static_cast<id_t>(run.pid()), &ended, WEXITED | WNOWAIT), 0);
+    ASSERT_NE(processLine(run.pid()), "");
+    releaseLocksOfEndedRuns(second.manager);
+    EXPECT_EQ(second.write("dateFile", "who"), 204);
 }
 
 TEST_F(Locks, WhatLivingRunsHoldIsLeftToThem) {
@@ -153,7 +183,7 @@ TEST_F(Locks, WhatLivingRunsHoldIsLeftToThem) {
 TEST_F(Locks, ALockThatCouldNotBeGivenBackIsGivenBackAnotherTime) {
     for (const bool knewItsToken : {true, false}) {
         ASSERT_TRUE(lock(alice)->tryLock());
-        killRunsOfThisProcess(knewItsToken);
+        giveLocksOfThisProcessTo(kEndedRun, knewItsToken);
         HttpResponse lost;
         lost.error = TransportError::unreachable;
         second.wire->intercept([&](const HttpRequest&) { return std::optional(lost); });
@@ -185,8 +215,8 @@ TEST_F(Locks, AnAskedLockIsNotedBeforeItIsHadAndARefusedOneIsStruck) {
 TEST_F(Locks, OldRunsAreForgottenAndWhatElseLiesThereIsNoHindrance) {
     const std::filesystem::path runs = stateDirectory() + "/locks-runs";
     std::filesystem::create_directories(runs / "a directory");
-    writeFileDurably(runs / "ended", "1 0");
-    writeFileDurably(runs / "recent", "1 0");
+    writeFileDurably(runs / "ended", kEndedRun);
+    writeFileDurably(runs / "recent", kEndedRun);
     const auto longAgo = std::filesystem::file_time_type::clock::now() - std::chrono::hours(24);
     for (const char* old : {"a directory", "ended"}) std::filesystem::last_write_time(runs / old, longAgo);
     auto mine = lock(alice);
