@@ -8,6 +8,7 @@ import plistlib
 import ssl
 import urllib.parse
 import xml.etree.ElementTree as ElementTree
+from xml.parsers.expat import ExpatError
 
 DAV = "{DAV:}"
 
@@ -53,7 +54,11 @@ class StoreView:
             return None
         if status != 200:  # 403 is also what httpd says of a file that goes while it is being opened
             raise Unreadable(f"GET {'/'.join(parts)}: status {status}")
-        return plistlib.loads(body, fmt=plistlib.FMT_XML)
+        try:
+            return plistlib.loads(body, fmt=plistlib.FMT_XML)
+        except (plistlib.InvalidFileException, ExpatError) as error:
+            # So does httpd answer for a moment when a file is replaced by a longer one: with as much as it was long.
+            raise Unreadable(f"GET {'/'.join(parts)}: {len(body)} bytes are no property list: {error}")
 
     def names(self, *parts):
         """(files, directories) in a directory."""
