@@ -36,13 +36,13 @@ std::string counted(size_t count, const char* one, const char* several) {
 // Asks the store whether there is something that may be read, and says clearly why not.
 void requirePublication(const RemoteLocation& location) {
     const std::string user = publisherOf(location), self = CXDAVManager::vaultraUser();
+    int code = 0;
+    const Url info = Url(location.str()).cxURLByAppendingComponent(layout::kInfo);
+    if (CXDAVManager::defaultManager().dictionaryAtURL(info, false, &code)) return;
     CXDAVError error;
     if (!CXDAVManager::canReachOstrelError(error))
         throw CommandError(error.code == kCXDAVErrorAuthentication ? kRefused : kUnreachable,
                            error.reason + " Nothing was subscribed to.");
-    int code = 0;
-    const Url info = Url(location.str()).cxURLByAppendingComponent(layout::kInfo);
-    if (CXDAVManager::defaultManager().dictionaryAtURL(info, false, &code)) return;
     if (code == kForbidden)
         throw CommandError(kRefused, fmt::format("The store does not let you read the contacts of \"{0}\". Check the "
                                                  "name, or ask for the right to read: `rolvane share {1}`, typed by "

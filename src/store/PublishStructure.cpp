@@ -5,6 +5,7 @@
 #include "foundation/PropertyList.h"
 #include "store/StoreListing.h"
 
+#include <algorithm>
 #include <set>
 
 namespace rolvane {
@@ -105,39 +106,39 @@ bool PublishStructure::makeTree() {
     return _files.makeCollection(tree);
 }
 
-// All at once; one that exists already, because somebody else makes the structure too, is as good.
-bool PublishStructure::makeAll(const std::vector<Url>& collections) {
-    std::vector<HttpRequest> requests;
-    for (const Url& name : collections) requests.push_back(StoreSession::request("MKCOL", *_session.endpoint(name)));
-    const auto answers = _session.sendAll(std::move(requests));
-    for (const HttpResponse& answer : answers)
-        if (!answer.ok() && answer.status != 405) return false;
-    return true;
+HttpRequest PublishStructure::making(const Url& collection) const {
+    return StoreSession::request("MKCOL", *_session.endpoint(collection));
 }
 
 // A file that must not replace another one.
-bool PublishStructure::writeNew(const Url& name, const std::string& text) {
+HttpRequest PublishStructure::writingNew(const Url& name, const std::string& text) const {
     HttpRequest request = StoreSession::request("PUT", *_session.endpoint(name));
     request.headers = {{"If-None-Match", "*"}, {"Content-Type", "application/xml; charset=utf-8"}};
     request.body = std::make_shared<const std::string>(text);
-    const HttpResponse answer = _session.send(std::move(request));
-    return answer.ok() || answer.status == 412;
+    return request;
+}
+
+// All at once. What exists already (405 and 412), because somebody else makes the structure too, is as good.
+bool PublishStructure::makeAll(std::vector<HttpRequest> requests) {
+    const auto answers = _session.sendAll(std::move(requests));
+    return std::all_of(answers.begin(), answers.end(), [](const HttpResponse& answer) {
+        return answer.ok() || answer.status == 405 || answer.status == 412;
+    });
 }
 
 bool PublishStructure::complete(const Missing& missing) {
     const Url people = base().cxURLByAppendingComponent("People");
     if (missing.tree && !makeTree()) return false;
-    if (missing.people && !makeAll({people})) return false;
-    std::vector<Url> buckets;
+    if (missing.people && !makeAll({making(people)})) return false;
+    std::vector<HttpRequest> rest;
     for (const int bucket : missing.buckets)
-        buckets.push_back(people.cxURLByAppendingComponent(std::to_string(bucket)));
-    if (!buckets.empty() && !makeAll(buckets)) return false;
-    if (missing.dateFile && !writeNew(base().cxURLByAppendingComponent("dateFile"), "why")) return false;
+        rest.push_back(making(people.cxURLByAppendingComponent(std::to_string(bucket))));
+    if (missing.dateFile) rest.push_back(writingNew(base().cxURLByAppendingComponent("dateFile"), "why"));
     if (missing.info) {
         const Dictionary info{{"SerialNumber", _serial.empty() ? makeUUID() : _serial}};
-        if (!writeNew(base().cxURLByAppendingComponent("info"), PropertyList::toXML(info))) return false;
+        rest.push_back(writingNew(base().cxURLByAppendingComponent("info"), PropertyList::toXML(info)));
     }
-    return true;
+    return rest.empty() || makeAll(std::move(rest));
 }
 
 } // namespace rolvane

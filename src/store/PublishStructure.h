@@ -8,9 +8,9 @@
 
 namespace rolvane {
 
-// The tree that a publisher needs on the store: the tree itself, "People" with its buckets "0" to "31", "dateFile" and
-// "info". They are made in this order, so that a tree that has "info" was once complete, and one listing tells it; when
-// a write finds a folder missing, everything is looked at. Any thread.
+// The tree that a publisher needs on the store: the tree itself, "People", and then all at once its buckets "0" to
+// "31", "dateFile" and "info". One listing tells that a tree has been made. Whoever is ended while making it may leave
+// buckets out: when a write finds a folder missing, everything is looked at. Any thread.
 class PublishStructure {
 public:
     PublishStructure(StoreSession& session, StoreFiles& files) : _session(session), _files(files) {}
@@ -33,8 +33,9 @@ private:
     Missing look(bool everything);
     bool complete(const Missing& missing);
     bool makeTree();
-    bool makeAll(const std::vector<Url>& collections);
-    bool writeNew(const Url& name, const std::string& text);
+    HttpRequest making(const Url& collection) const;
+    HttpRequest writingNew(const Url& name, const std::string& text) const;
+    bool makeAll(std::vector<HttpRequest> requests);
     Url base() const { return _session.account().baseLocationFor(_session.account().user); }
 
     StoreSession& _session;

@@ -43,14 +43,14 @@ bool isBaseLocation(const Url& name) {
 
 } // namespace
 
-std::vector<StoreListing::Members> StoreListing::members(const std::vector<Url>& containers, bool withMembersTags) {
+std::vector<StoreListing::Members> StoreListing::members(const std::vector<Url>& containers, const Url* tagged) {
     std::vector<std::shared_ptr<Staged>> staged;
     std::vector<HttpRequest> requests;
     std::vector<Members> out(containers.size());
     for (const Url& name : containers) {
         const auto url = _session.endpoint(name);
         if (!url) return out;
-        HttpRequest r = StoreSession::propfind(Url(asDirectory(*url)), 1, withMembersTags);
+        HttpRequest r = StoreSession::propfind(Url(asDirectory(*url)), 1, tagged && *tagged == name);
         r.limits = {300, 60, kListingBytes, 64u << 10};
         auto reading = std::make_shared<Staged>();
         r.sink = [reading](std::string_view bytes) { return reading->sound = reading->reader.feed(bytes); };
@@ -135,16 +135,14 @@ bool StoreListing::addStates(const std::vector<Url>& groups, FileListing& out) {
 
 // The tags are told before the buckets are listed: what changes in between is in the listing already, and listed again
 // the next time.
-bool StoreListing::addBuckets(const Url& people, FileListing& out) {
-    const bool tagged = _session.givesMembersTags();
-    const auto level = members({people}, tagged);
-    if (!level.front().entries) return false;
+bool StoreListing::addBuckets(const Members& people, bool tagged, FileListing& out) {
+    if (!people.entries) return false;
     std::vector<Url> none, names;
     std::vector<std::string> tags;
-    for (const auto& [name, entry] : *level.front().entries) {
+    for (const auto& [name, entry] : *people.entries) {
         if (!entry.isCollection || StoreFiles::isReservedName(name.cxLastComponent())) continue;
         const std::string tag = tagged ? entry.membersTag : std::string();
-        if (addUnchanged(name, tag, level.front().serverDate, out)) continue;
+        if (addUnchanged(name, tag, people.serverDate, out)) continue;
         names.push_back(name);
         tags.push_back(tag);
     }
@@ -178,16 +176,15 @@ bool StoreListing::addUnchanged(const Url& container, const std::string& tag, co
 
 std::optional<FileListing> StoreListing::list(const Url& container) {
     FileListing out;
-    std::vector<Url> groups;
-    const auto own = members({container});
-    if (!addEntries(own.front(), out, groups)) return std::nullopt;
-    if (!isBaseLocation(container)) return addStates(groups, out) ? std::optional(out) : std::nullopt;
-
+    std::vector<Url> groups, asked{container};
     const Url people = container.cxURLByAppendingComponent("People");
+    if (isBaseLocation(container)) asked.push_back(people); // nearly always there, and a way to the store saved
+    const bool tagged = _session.givesMembersTags();
+    const auto answers = members(asked, tagged ? &people : nullptr);
+    if (!addEntries(answers.front(), out, groups)) return std::nullopt;
     const auto found = out.find(pathOf(people));
-    if (found != out.end() && found->second.isCollection) {
-        if (!addBuckets(people, out)) return std::nullopt;
-    }
+    const bool holdsPeople = asked.size() == 2 && found != out.end() && found->second.isCollection;
+    if (holdsPeople && !addBuckets(answers.back(), tagged, out)) return std::nullopt;
     return addStates(groups, out) ? std::optional(std::move(out)) : std::nullopt;
 }
 

@@ -32,10 +32,11 @@ public:
         std::optional<std::vector<std::pair<Url, MultistatusEntry>>> entries; // by name; the container itself left out
         std::optional<Date> serverDate;
     };
-    std::vector<Members> members(const std::vector<Url>& containers, bool withMembersTags = false);
+    // `tagged`: of that one's members the tags are asked for, too.
+    std::vector<Members> members(const std::vector<Url>& containers, const Url* tagged = nullptr);
 
 private:
-    bool addBuckets(const Url& people, FileListing& out);
+    bool addBuckets(const Members& people, bool tagged, FileListing& out);
     bool addUnchanged(const Url& container, const std::string& tag, const std::optional<Date>& serverDate,
                       FileListing& out);
     bool addEntries(const Members& members, FileListing& out, std::vector<Url>& groupCollections);

@@ -169,11 +169,18 @@ void StoreSession::start(HttpRequest request, HttpTransport::Completion done) {
 }
 
 HttpResponse StoreSession::options() {
+    return optionsAndMore({}).front();
+}
+
+// The answers to an OPTIONS of the account's tree, which is heeded, and to the requests, sent with it.
+std::vector<HttpResponse> StoreSession::optionsAndMore(std::vector<HttpRequest> requests) {
     const auto base = endpoint(_account.baseLocationFor(_account.user));
-    if (!base) return {};
+    if (!base) return std::vector<HttpResponse>(requests.size() + 1);
     HttpRequest r = request("OPTIONS", *base);
     r.limits = {20, 10, 1u << 20, 64u << 10};
-    HttpResponse answer = _transport->perform(std::move(r));
+    requests.insert(requests.begin(), std::move(r));
+    std::vector<HttpResponse> answers = _transport->performAll(std::move(requests));
+    const HttpResponse& answer = answers.front();
     if (answer.complete() && (answer.ok() || answer.status == 403 || answer.status == 404) && announcesDav1(answer)) {
         _davSeen = steadyMilliseconds();
         _accessLists = announcesDavClass(answer, "access-control") ? 1 : 0;
@@ -181,7 +188,7 @@ HttpResponse StoreSession::options() {
     } else if (answer.status != 401) {
         _davSeen = 0;
     }
-    return answer;
+    return answers;
 }
 
 std::optional<bool> StoreSession::keepsAccessLists() {
@@ -229,22 +236,18 @@ bool StoreSession::canReach(CXDAVError& error) {
         error = {kCXDAVErrorNoPassword, "The password of the account cannot be had."};
         return false;
     }
-    const HttpResponse answer = options();
-    if (!answer.complete() || answer.status == 401 || _davSeen == 0) {
-        error = errorFrom(answer, "OPTIONS");
+    // Servers may answer OPTIONS without looking at the login, so the login is proven once by a request that needs it.
+    std::vector<HttpRequest> proof;
+    if (const auto tree = endpoint(_account.baseLocationFor(_account.user)); tree && needsLoginProof)
+        proof.push_back(propfind(*tree, 0));
+    const std::vector<HttpResponse> answers = optionsAndMore(std::move(proof));
+    for (size_t i = 0; i < answers.size(); ++i) {
+        const HttpResponse& answer = answers[i];
+        if (answer.complete() && answer.status != 401 && _davSeen != 0) continue;
+        error = errorFrom(answer, i == 0 ? "OPTIONS" : "PROPFIND");
         std::lock_guard guard(_mutex);
         _loginRefused = _loginRefused || answer.status == 401;
         return false;
-    }
-    // Servers may answer OPTIONS without looking at the login, so the login is proven once by a request that needs it.
-    if (needsLoginProof) {
-        const HttpResponse proof = _transport->perform(propfind(*endpoint(_account.baseLocationFor(_account.user)), 0));
-        if (!proof.complete() || proof.status == 401) {
-            error = errorFrom(proof, "PROPFIND");
-            std::lock_guard guard(_mutex);
-            _loginRefused = _loginRefused || proof.status == 401;
-            return false;
-        }
     }
     std::lock_guard guard(_mutex);
     _loginProven = true;

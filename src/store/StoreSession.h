@@ -56,6 +56,7 @@ private:
     bool signIn();
     bool isDavServer();
     HttpResponse options();
+    std::vector<HttpResponse> optionsAndMore(std::vector<HttpRequest> requests);
     CXDAVError errorFrom(const HttpResponse& answer, const char* asked) const;
 
     const CXDAVAccount _account;
