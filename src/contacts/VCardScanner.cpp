@@ -42,6 +42,43 @@ std::string headOf(const std::string& text) {
     return vcardUpper(text.substr(0, std::min<size_t>(text.find(':'), 512)));
 }
 
+// Whether the parameters before the value say that it is quoted-printable.
+bool isQuotedPrintable(const std::string& text) {
+    bool quoted = false;
+    size_t start = std::string::npos;
+    for (size_t i = 0; i < text.size(); i++) {
+        if (text[i] == '"') quoted = !quoted;
+        if (quoted || (text[i] != ';' && text[i] != ':')) continue;
+        if (start != std::string::npos) {
+            std::string parameter = vcardUpper(text.substr(start, i - start));
+            size_t equals = parameter.find('=');
+            std::string_view value = vcardTrim(std::string_view(parameter).substr(equals + 1)); // npos + 1 is 0
+            bool encoding = equals == std::string::npos || vcardTrim(parameter.substr(0, equals)) == "ENCODING";
+            if (encoding && (value == "QUOTED-PRINTABLE" || value == "\"QUOTED-PRINTABLE\"")) return true;
+        }
+        if (text[i] == ':') return false;
+        start = i + 1;
+    }
+    return false;
+}
+
+// The value with its line ends as escapes. A backslash that stands alone before one is doubled, lest the two become
+// one escape.
+std::string withEscapedLineEnds(std::string_view value) {
+    std::string out;
+    bool open = false; // an odd number of backslashes stands before
+    for (size_t i = 0; i < value.size(); i++) {
+        char c = value[i];
+        if (c == '\r' && i + 1 < value.size() && value[i + 1] == '\n') continue;
+        if (c == '\n' || c == '\r')
+            out += open ? "\\\\n" : "\\n";
+        else
+            out += c;
+        open = c == '\\' && !open;
+    }
+    return out;
+}
+
 bool isBase64Head(const std::string& head) {
     return head.find("BASE64") != std::string::npos || head.find("ENCODING=B") != std::string::npos;
 }
@@ -125,7 +162,7 @@ size_t VCardScanner::limitFor(const std::string& text) const {
 // Whether the physical line continues the logical one; what it adds is appended by the caller after this has taken a
 // soft line break off.
 bool VCardScanner::continues(Unfolded& line, const std::string& next) const {
-    if (line.text.ends_with('=') && headOf(line.text).find("QUOTED-PRINTABLE") != std::string::npos) {
+    if (line.text.ends_with('=') && isQuotedPrintable(line.text)) {
         line.text.pop_back();
         return true;
     }
@@ -254,6 +291,11 @@ bool VCardScanner::addLine(VCard& card, Unfolded& line) {
     } else if (vcardFirstInvalidUTF8(line.text)) {
         reason = "the text is not UTF-8";
     }
+    if (good && (parsed->name == "BEGIN" || parsed->name == "END")) {
+        // A damaged mark: what follows may be another card's.
+        reason = "the line " + parsed->name + " is neither BEGIN:VCARD nor END:VCARD";
+        good = false;
+    }
     if (good && parsed->name == "VERSION") {
         good = setVersion(card, *parsed, reason);
         _version21 = card.version == "2.1";
@@ -277,6 +319,7 @@ bool VCardScanner::setVersion(VCard& card, const VCardLine& line, std::string& r
 // Resolves quoted-printable and CHARSET, and makes sure of the characters.
 bool VCardScanner::decodeLine(VCardLine& line, std::string& reason) const {
     std::string charset;
+    bool decoded = false;
     std::erase_if(line.parameters, [&](const VCardParameter& p) {
         bool spent = p.name == "CHARSET";
         if (spent && !p.values.empty()) charset = p.values.front();
@@ -284,18 +327,7 @@ bool VCardScanner::decodeLine(VCardLine& line, std::string& reason) const {
         const std::string& how = p.values.front();
         if (vcardEqualNoCase(how, "QUOTED-PRINTABLE")) {
             line.value = vcardDecodeQuotedPrintable(line.value);
-            // A decoded line end is text; in the value of a content line it is written as an escape.
-            std::string joined;
-            for (size_t i = 0; i < line.value.size(); i++) {
-                char c = line.value[i];
-                if (c == '\r' && i + 1 < line.value.size() && line.value[i + 1] == '\n') continue;
-                if (c == '\n' || c == '\r')
-                    joined += "\\n";
-                else
-                    joined += c;
-            }
-            line.value = std::move(joined);
-            return true;
+            return decoded = true;
         }
         return vcardEqualNoCase(how, "8BIT") || vcardEqualNoCase(how, "7BIT");
     });
@@ -307,7 +339,10 @@ bool VCardScanner::decodeLine(VCardLine& line, std::string& reason) const {
             return false;
         }
         line.value = std::move(*converted);
+        decoded = true;
     }
+    // A decoded line end is text; in the value of a content line it is written as an escape.
+    if (decoded && line.value.find_first_of("\r\n") != std::string::npos) line.value = withEscapedLineEnds(line.value);
     auto clean = [&](const std::string& s) {
         if (vcardFirstInvalidUTF8(s))
             reason = "the text is not UTF-8";

@@ -157,6 +157,40 @@ TEST(VCardScanner, QuotedPrintableTextGoesOnAfterASoftBreak) {
     EXPECT_EQ(r.cards[0].lines[1].value, "x");
 }
 
+TEST(VCardScanner, ALoneBackslashBeforeADecodedLineEndStays) {
+    auto r = scan(card("NOTE;QUOTED-PRINTABLE:C:=5C=0D=0Ad\r\nNOTE;QUOTED-PRINTABLE:e=5C=5C=0Af\r\n", "2.1"));
+    ASSERT_EQ(r.cards.size(), 1u);
+    EXPECT_EQ(vcardUnescape(r.cards[0].lines[0].value), "C:\\\nd");
+    EXPECT_EQ(vcardUnescape(r.cards[0].lines[1].value), "e\\\nf");
+}
+
+TEST(VCardScanner, OnlyAnEncodingMakesALineQuotedPrintable) {
+    for (const char* line : {"X-A;X-B=QUOTED-PRINTABLE:abc=", "X-A;X-B=\";QUOTED-PRINTABLE;\":abc=",
+                             "X-QUOTED-PRINTABLE:abc=", "X-A:a;QUOTED-PRINTABLE:="}) {
+        auto r = scan(card(std::string(line) + "\r\nFN:x\r\n"));
+        ASSERT_EQ(r.cards.size(), 1u);
+        EXPECT_EQ(r.cards[0].lines.size(), 2u) << line;
+    }
+    for (const char* line : {"X-A;X-B=\"a:b\";ENCODING=quoted-printable:a=", "X-A; ENCODING = QUOTED-PRINTABLE :a=",
+                             "X-A;quoted-printable;X-B=1:a="}) {
+        auto r = scan(card(std::string(line) + "\r\nFN:x\r\n"));
+        ASSERT_EQ(r.cards.size(), 1u) << line;
+        ASSERT_EQ(r.cards[0].lines.size(), 1u) << line;
+        EXPECT_EQ(r.cards[0].lines[0].value, "aFN:x");
+    }
+}
+
+TEST(VCardScanner, ADamagedBeginOrEndMakesItsCardBad) {
+    for (const char* mark : {"END:VCAR", "END:", "END;X-A=1:VCARD", "item1.END:VCARD", "BEGIN:VEVENT", "begin:x"}) {
+        auto r = scan(card("FN:Ann\r\n" + std::string(mark) + "\r\nFN:Bob\r\n") + card("FN:good\r\n"));
+        ASSERT_EQ(r.cards.size(), 1u) << mark;
+        EXPECT_EQ(r.cards[0].lines[0].value, "good");
+        ASSERT_EQ(r.errors.size(), 1u) << mark;
+        EXPECT_EQ(r.errors[0].line, 4u);
+        EXPECT_NE(r.errors[0].reason.find("neither BEGIN:VCARD nor END:VCARD"), std::string::npos);
+    }
+}
+
 TEST(VCardScanner, Base64OfOldCardsMayStandAtTheLeftMargin) {
     std::string unit(64, 'A');
     auto r = scan(card("PHOTO;PNG;BASE64:" + unit + "\r\n" + unit + "\r\n " + unit + "\r\n\r\nFN:x\r\n", "2.1"));
