@@ -24,6 +24,20 @@ constexpr std::array<VCardMultiField, 7> kMultiFields{{
     {"DATE", kCXOtherDatesProperty, false, false, "DATE"},
 }};
 
+// The first name of a property is the one that is written.
+constexpr std::pair<const char*, const char*> kTextLines[] = {
+    {"NOTE", kCXNoteProperty},
+    {"TITLE", kCXJobTitleProperty},
+    {"X-ROLVANE-MAIDEN-NAME", kCXMaidenNameProperty},
+    {"X-MAIDENNAME", kCXMaidenNameProperty},
+    {"X-ROLVANE-PHONETIC-FIRST", kCXFirstNamePhoneticProperty},
+    {"X-PHONETIC-FIRST-NAME", kCXFirstNamePhoneticProperty},
+    {"X-ROLVANE-PHONETIC-MIDDLE", kCXMiddleNamePhoneticProperty},
+    {"X-PHONETIC-MIDDLE-NAME", kCXMiddleNamePhoneticProperty},
+    {"X-ROLVANE-PHONETIC-LAST", kCXLastNamePhoneticProperty},
+    {"X-PHONETIC-LAST-NAME", kCXLastNamePhoneticProperty},
+};
+
 constexpr std::string_view kOwnPrefix = "X-ROLVANE-";
 
 constexpr std::array<const char*, 7> kAddressKeys{kCXAddressPOBoxKey,  kCXAddressExtendedKey, kCXAddressStreetKey,
@@ -64,8 +78,7 @@ std::optional<std::string> encodeAddress(const Value& value) {
         used++;
     }
     const Value& code = (*address)[kCXAddressCountryCodeKey];
-    if (code && (!code.isString() || code.string().empty() || !vcardIsPlainText(code.string()) || used == 0 ||
-                 vcardTrim(code.string()) != code.string()))
+    if (code && (!code.isString() || code.string().empty() || !vcardIsPlainText(code.string()) || used == 0))
         return std::nullopt;
     if (used + (code ? 1 : 0) != address->count()) return std::nullopt; // keys that an ADR has no place for
     return raw;
@@ -112,7 +125,7 @@ std::optional<std::chrono::sys_days> decodeDay(std::string_view t) {
     std::chrono::year_month_day day{std::chrono::year(number(p.substr(0, 4))),
                                     std::chrono::month(static_cast<unsigned>(number(p.substr(4, 2)))),
                                     std::chrono::day(static_cast<unsigned>(number(p.substr(6, 2))))};
-    if (!day.ok()) return std::nullopt;
+    if (!day.ok() || day.year() < std::chrono::year(1)) return std::nullopt; // what could not be written again
     return std::chrono::sys_days(day);
 }
 
@@ -170,6 +183,15 @@ bool startsWith(const Bytes& bytes, std::string_view magic, size_t at = 0) {
                       [](char a, uint8_t b) { return static_cast<uint8_t>(a) == b; });
 }
 
+std::string digestOf(const Bytes& bytes) {
+    if (bytes.empty()) return "";
+    Bytes digest(EVP_MAX_MD_SIZE);
+    unsigned length = 0;
+    EVP_Digest(bytes.data(), bytes.size(), digest.data(), &length, EVP_sha256(), nullptr);
+    digest.resize(length);
+    return vcardEncodeBase64(digest);
+}
+
 std::string firstValueOf(const Dictionary& person, std::string_view property) {
     const Array* values =
         person[property].dictionaryIf() ? (*person[property].dictionaryIf())["values"].arrayIf() : nullptr;
@@ -198,6 +220,10 @@ const VCardMultiField* vcardMultiFieldForProperty(std::string_view property) {
     return nullptr;
 }
 
+bool vcardIsLabelLine(const VCardLine& line) {
+    return !line.group.empty() && line.name.starts_with("X-") && line.name.ends_with("LABEL");
+}
+
 bool vcardIsPlainText(std::string_view text) {
     return !vcardFirstInvalidUTF8(text) && !vcardHasControlCharacter(text);
 }
@@ -209,9 +235,9 @@ Value vcardDecodeMultiValue(std::string_view property, const VCardLine& line) {
         return date ? Value(*date) : Value();
     }
     bool uri = vcardEqualNoCase(line.firstValueOf("VALUE"), "uri");
-    // A relation to another card is not a name; the line is kept as it is.
-    if (property == kCXRelatedNamesProperty && (uri || line.value.starts_with("urn:"))) return {};
     std::string text = vcardUnescape(line.value);
+    // A relation to another card is not a name; the line is kept as it is.
+    if (property == kCXRelatedNamesProperty && (uri || text.starts_with("urn:"))) return {};
     if (property == kCXPhoneProperty && uri && vcardLower(text.substr(0, 4)) == "tel:") text.erase(0, 4);
     if (vcardTrim(text).empty()) return {};
     return text;
@@ -261,13 +287,27 @@ std::string vcardEncodeName(const Dictionary& person) {
     return raw;
 }
 
+std::string vcardSurplusParts(const VCardLine& line) {
+    if (line.name != "ADR" && line.name != "N") return "";
+    size_t known = line.name == "ADR" ? kAddressKeys.size() : kNameKeys.size();
+    auto parts = vcardSplit(line.value, ';');
+    if (parts.size() <= known) return "";
+    std::string surplus;
+    bool blank = true;
+    for (size_t i = known; i < parts.size(); i++) {
+        (surplus += i > known ? ";" : "") += parts[i];
+        blank = blank && vcardTrim(parts[i]).empty();
+    }
+    return blank ? "" : surplus;
+}
+
 void vcardDecodeOrganization(const VCardLine& line, Dictionary& person) {
     auto parts = vcardSplit(line.value, ';');
     while (parts.size() > 1 && vcardTrim(parts.back()).empty()) parts.pop_back();
     std::string department;
     for (size_t i = 1; i < parts.size(); i++) (department += i > 1 ? "; " : "") += vcardUnescape(parts[i]);
     std::string name = vcardUnescape(parts[0]);
-    if (!name.empty()) person.set(kCXOrganizationProperty, name);
+    if (!vcardTrim(name).empty()) person.set(kCXOrganizationProperty, name);
     if (!department.empty()) person.set(kCXDepartmentProperty, department);
 }
 
@@ -301,6 +341,68 @@ std::string vcardEncodeList(const std::vector<std::string>& items) {
     std::string raw;
     for (const auto& item : items) (raw += raw.empty() ? "" : ",") += vcardEscape(item);
     return raw;
+}
+
+void vcardDecodeNickname(const VCardLine& line, Dictionary& person) {
+    std::string all;
+    for (const auto& n : vcardDecodeList(line)) (all += all.empty() ? "" : ", ") += n;
+    if (!all.empty()) person.set(kCXNicknameProperty, all);
+}
+
+std::string vcardEncodeNickname(const Dictionary& person) {
+    std::string nickname = textOf(person, kCXNicknameProperty);
+    std::vector<std::string> items;
+    for (size_t start = 0; start != std::string::npos;) {
+        size_t end = nickname.find(", ", start);
+        items.push_back(nickname.substr(start, end == std::string::npos ? end : end - start));
+        start = end == std::string::npos ? end : end + 2;
+    }
+    Dictionary check;
+    VCardLine line;
+    line.value = vcardEncodeList(items);
+    vcardDecodeNickname(line, check);
+    return check[kCXNicknameProperty] == Value(nickname) ? line.value : vcardEscape(nickname);
+}
+
+const char* vcardTextPropertyForLine(std::string_view lineName) {
+    for (const auto& [line, property] : kTextLines)
+        if (lineName == line) return property;
+    return nullptr;
+}
+
+const char* vcardLineForTextProperty(std::string_view property) {
+    for (const auto& [line, p] : kTextLines)
+        if (property == p) return line;
+    return nullptr;
+}
+
+std::string vcardEncodeSingle(std::string_view lineName, const Dictionary& properties, bool isGroup) {
+    if (lineName == "FN" && isGroup) return vcardEscape(textOf(properties, kCXGroupNameProperty));
+    if (lineName == "FN") {
+        std::string formatted = textOf(properties, kCXFormattedNameProperty);
+        return vcardEscape(formatted.empty() ? vcardDerivedFormattedName(properties) : formatted);
+    }
+    if (lineName == "N") {
+        std::string name = vcardEncodeName(properties);
+        return name == ";;;;" ? "" : name;
+    }
+    if (lineName == "NICKNAME") return vcardEncodeNickname(properties);
+    if (lineName == "ORG") return vcardEncodeOrganization(properties);
+    if (lineName == "BDAY") {
+        if (auto date = properties[kCXBirthdayProperty].date()) return vcardEncodeDate(*date, true);
+        return vcardEscape(textOf(properties, kCXBirthdayTextProperty));
+    }
+    if (lineName == "PHOTO") return digestOf(properties[kCXPhotoProperty].data());
+    const char* property = vcardTextPropertyForLine(lineName);
+    return property ? vcardEscape(textOf(properties, property)) : std::string();
+}
+
+bool vcardIsNeverExact(std::string_view property) {
+    for (auto p :
+         {kCXVCardExtraProperty, kCXCategoriesProperty, kCXRemoteLocationProperty, kCXReadSharingACLProperty,
+          kCXReadWriteSharingACLProperty, kCXUIDProperty, kCXCreationDateProperty, kCXModificationDateProperty})
+        if (property == p) return true;
+    return false;
 }
 
 std::optional<Date> vcardDecodeDate(std::string_view text) {

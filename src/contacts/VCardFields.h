@@ -24,6 +24,9 @@ struct VCardMultiField {
 const VCardMultiField* vcardMultiFieldForLine(std::string_view lineName, bool labelled);
 const VCardMultiField* vcardMultiFieldForProperty(std::string_view property);
 
+// Extension properties that name the custom label of the other properties of their group: X-...LABEL.
+bool vcardIsLabelLine(const VCardLine& line);
+
 // One value of a multi-value property. Decoding gives an absent value when there is nothing in it or it is not of the
 // kind that the property holds (then the line is kept as it is); encoding nothing when the value has no such form.
 Value vcardDecodeMultiValue(std::string_view property, const VCardLine& line);
@@ -38,12 +41,30 @@ bool vcardIsPlainText(std::string_view text);
 // N: the five parts into and out of the person's dictionary. Lists inside a part are joined.
 void vcardDecodeName(const VCardLine& line, Dictionary& person);
 std::string vcardEncodeName(const Dictionary& person);
+// The parts of an ADR or N behind those that have a place in the dictionary (RFC 9554 knows some), raw; "" for none.
+std::string vcardSurplusParts(const VCardLine& line);
 // ORG: organisation and its units; several units are one department, separated by "; ".
 void vcardDecodeOrganization(const VCardLine& line, Dictionary& person);
 std::string vcardEncodeOrganization(const Dictionary& person);
 // NICKNAME and CATEGORIES are lists; several nicknames are one text, separated by ", ".
 std::vector<std::string> vcardDecodeList(const VCardLine& line);
 std::string vcardEncodeList(const std::vector<std::string>& items);
+void vcardDecodeNickname(const VCardLine& line, Dictionary& person);
+std::string vcardEncodeNickname(const Dictionary& person);
+
+// Properties that stand as one text in a line of their own: NOTE, TITLE and the like. Some have several names; the
+// second function gives the one that is written. Null for none.
+const char* vcardTextPropertyForLine(std::string_view lineName);
+const char* vcardLineForTextProperty(std::string_view property);
+
+// The raw value of a line of which a card has one (FN, N, NICKNAME, ORG, BDAY, PHOTO and those of
+// vcardTextPropertyForLine, by the names that are written), "" when the properties have none. A BDAY is in the form of
+// vCard 4.0; for a PHOTO it is a digest of the bytes.
+std::string vcardEncodeSingle(std::string_view lineName, const Dictionary& properties, bool isGroup);
+
+// Properties that no card may set by an exact value: with whom something is shared, and what is written by rules of its
+// own.
+bool vcardIsNeverExact(std::string_view property);
 
 // A full date, with or without time in UTC, in the basic or the extended form ("19850412", "1985-04-12T10:00:00Z").
 // Anything else, the truncated forms of vCard 4.0 among it, is nothing.

@@ -183,6 +183,14 @@ bool VCardLine::hasType(std::string_view type) const {
     return false;
 }
 
+bool VCardLine::isStillEncoded() const {
+    if (parameter("CHARSET")) return true;
+    std::string encoding = firstValueOf("ENCODING");
+    for (const char* e : {"QUOTED-PRINTABLE", "8BIT", "7BIT"})
+        if (vcardEqualNoCase(encoding, e)) return true;
+    return false;
+}
+
 void VCardLine::add(std::string_view parameterName, std::string parameterValue) {
     for (auto& p : parameters) {
         if (p.name != parameterName) continue;

@@ -29,6 +29,8 @@ struct VCardLine {
     std::string firstValueOf(std::string_view parameterName) const;        // "" for none
     bool hasType(std::string_view type) const; // a value of any TYPE parameter, without case
     std::vector<std::string> types() const;    // of all TYPE parameters, in small letters
+    // Of a named character set or in a transfer encoding of mail, which scanning resolves.
+    bool isStillEncoded() const;
     void add(std::string_view parameterName,
              std::string parameterValue); // to the parameter of that name, made if absent
 

@@ -10,15 +10,11 @@
 
 #include <algorithm>
 #include <map>
+#include <set>
 
 namespace rolvane {
 
 namespace {
-
-// Extension properties that name the custom label of the other property of their group: X-...LABEL.
-bool isLabelLine(const VCardLine& line) {
-    return !line.group.empty() && line.name.starts_with("X-") && line.name.ends_with("LABEL");
-}
 
 bool isKindLine(const VCardLine& line) {
     return line.name == "KIND" || (line.name.starts_with("X-") && line.name.ends_with("-KIND"));
@@ -28,31 +24,7 @@ bool isMemberLine(const VCardLine& line) {
     return line.name == "MEMBER" || (line.name.starts_with("X-") && line.name.ends_with("-MEMBER"));
 }
 
-constexpr std::pair<const char*, const char*> kTextLines[] = {
-    {"FN", kCXFormattedNameProperty},
-    {"NOTE", kCXNoteProperty},
-    {"TITLE", kCXJobTitleProperty},
-    {"X-ROLVANE-MAIDEN-NAME", kCXMaidenNameProperty},
-    {"X-MAIDENNAME", kCXMaidenNameProperty},
-    {"X-ROLVANE-PHONETIC-FIRST", kCXFirstNamePhoneticProperty},
-    {"X-PHONETIC-FIRST-NAME", kCXFirstNamePhoneticProperty},
-    {"X-ROLVANE-PHONETIC-MIDDLE", kCXMiddleNamePhoneticProperty},
-    {"X-PHONETIC-MIDDLE-NAME", kCXMiddleNamePhoneticProperty},
-    {"X-ROLVANE-PHONETIC-LAST", kCXLastNamePhoneticProperty},
-    {"X-PHONETIC-LAST-NAME", kCXLastNamePhoneticProperty},
-};
-
-const char* textPropertyFor(std::string_view name) {
-    for (const auto& [line, property] : kTextLines)
-        if (name == line) return property;
-    return nullptr;
-}
-
-// Properties that no file may set: they say with whom something is shared.
-bool isForbidden(std::string_view property) {
-    return property == kCXRemoteLocationProperty || property == kCXReadSharingACLProperty ||
-           property == kCXReadWriteSharingACLProperty;
-}
+constexpr int kNoPreference = 1000;
 
 int preferenceOf(const VCardLine& line) {
     const VCardParameter* p = line.parameter("PREF");
@@ -60,7 +32,7 @@ int preferenceOf(const VCardLine& line) {
         int n = std::atoi(p->values.front().c_str());
         return n >= 1 && n <= 100 ? n : 100;
     }
-    return line.hasType("pref") ? 1 : 1000;
+    return line.hasType("pref") ? 1 : kNoPreference;
 }
 
 class Reader {
@@ -72,6 +44,7 @@ public:
         studyGroups();
         for (const auto& line : _card.lines)
             if (!take(line)) return std::nullopt;
+        keepUnusedLabels();
         storeMultiValues();
         if (!applyExactValues()) return std::nullopt;
         finishNames();
@@ -91,32 +64,38 @@ private:
         Value value;
     };
 
+    // A line whose parameters and group may have to be kept.
+    struct MultiCarrier {
+        const VCardLine* line;
+        const VCardMultiField* field;
+        std::string label;
+        Value value;
+    };
+
     std::nullopt_t bad(size_t line, std::string reason) {
         _error.line = line;
         _error.reason = std::move(reason);
         return std::nullopt;
     }
 
-    // Custom labels, how many lines a group name holds together, and whether this is a group's card.
+    // Custom labels, and whether this is a group's card.
     void studyGroups() {
         for (const auto& line : _card.lines) {
-            if (isLabelLine(line))
-                _labels.emplace(line.group, vcardUnescape(line.value));
-            else if (!line.group.empty())
-                _groupUse[line.group]++;
+            if (vcardIsLabelLine(line)) _labels.emplace(line.group, vcardUnescape(line.value));
             if (isKindLine(line) && vcardEqualNoCase(vcardTrim(line.value), "group")) _entity.isGroup = true;
         }
     }
 
     bool take(const VCardLine& line) {
-        if (isLabelLine(line) && _groupUse.count(line.group)) return true;
+        if (vcardIsLabelLine(line)) return _labelLines.push_back(&line), true;
         if (line.name == "PRODID" || line.name == "REV") return true; // of the file that was, not of the person
         if (line.name == "UID") return takeUID(line);
         if (isKindLine(line)) return takeKind(line);
         if (line.name == "X-ROLVANE-VALUE") return takeExactValue(line);
+        if (line.name == "X-ROLVANE-KEPT") return takeKept(line);
         if (_entity.isGroup && takeOfGroup(line)) return true;
         if (line.name == "PHOTO") return takePhoto(line);
-        if (line.name == "CATEGORIES") {
+        if (line.name == "CATEGORIES" && !_entity.isGroup) {
             auto names = vcardDecodeList(line);
             _entity.categories.insert(_entity.categories.end(), names.begin(), names.end());
             return true;
@@ -152,11 +131,30 @@ private:
                                        line.firstValueOf("X-LABEL"), line.value});
             return true;
         }
-        bool names = line.name == "FN" || (line.name == "N" && !_entity.properties[kCXGroupNameProperty]);
-        if (!names) return line.name == "N";
-        std::string name =
-            line.name == "FN" ? vcardUnescape(line.value) : vcardUnescape(vcardSplit(line.value, ';')[0]);
-        if (!vcardTrim(name).empty()) _entity.properties.set(kCXGroupNameProperty, name);
+        if (line.name == "FN") return takeGroupName(line);
+        if (line.name != "N") return false;
+        std::string name = vcardUnescape(vcardSplit(line.value, ';')[0]);
+        bool needed = !_entity.properties[kCXGroupNameProperty] && !vcardTrim(name).empty();
+        if (needed) _entity.properties.set(kCXGroupNameProperty, name);
+        return true;
+    }
+
+    bool takeGroupName(const VCardLine& line) {
+        std::string name = vcardUnescape(line.value);
+        if (vcardTrim(name).empty()) return true;
+        if (!_seen.insert(line.name).second) return false;
+        _entity.properties.set(kCXGroupNameProperty, name);
+        return carrySingle(line, line.name);
+    }
+
+    // A line that would mean something else if it stood for itself. Which card it is and whose cannot be said in it.
+    bool takeKept(const VCardLine& line) {
+        std::string text = vcardUnescape(line.value);
+        auto inner = vcardParseLine(text);
+        bool usable = inner && vcardIsPlainText(text) && !inner->isStillEncoded();
+        for (const char* name : {"BEGIN", "END", "VERSION", "UID", "X-ROLVANE-KEPT"})
+            usable = usable && inner->name != name;
+        keep(usable ? *inner : line);
         return true;
     }
 
@@ -171,7 +169,7 @@ private:
         }
         _entity.properties.set(kCXPhotoProperty, std::move(photo->bytes));
         if (!photo->mediaType.empty()) _entity.properties.set(kCXPhotoTypeProperty, photo->mediaType);
-        return true;
+        return carrySingle(line, line.name);
     }
 
     bool takeMulti(const VCardLine& line) {
@@ -180,44 +178,85 @@ private:
         bool labelled = custom != _labels.end();
         const VCardMultiField* field = vcardMultiFieldForLine(line.name, labelled);
         if (!field) return false;
-        if (line.name == "URL" && line.parameter("X-ROLVANE-HOMEPAGE")) {
-            _entity.properties.set(kCXHomePageProperty, vcardUnescape(line.value));
-            return true;
-        }
+        if (line.name == "URL" && line.parameter("X-ROLVANE-HOMEPAGE")) return takeHomePage(line);
         Value value = vcardDecodeMultiValue(field->property, line);
         if (!value) return vcardTrim(line.value).empty();
         std::string label = labelled                             ? custom->second
                             : line.name.ends_with("ANNIVERSARY") ? kCXAnniversaryLabel
                                                                  : vcardLabelForTypes(field->lineName, line.types());
-        carry(line, *field, label, value);
+        if (labelled) _usedLabels.insert(line.group);
+        use(line.group);
+        if (saysMore(line)) _multiCarriers.push_back({&line, field, label, value});
         _multi[field->property].push_back({preferenceOf(line), std::move(label), std::move(value)});
         return true;
     }
 
-    // Keeps what the value and its label do not say.
-    void carry(const VCardLine& line, const VCardMultiField& field, const std::string& label, const Value& value) {
-        VCardLine carrier;
-        carrier.name = field.lineName;
-        auto types = line.types();
-        bool needed = keptGroup(line) || vcardTypesAddToLabel(field.lineName, label, types);
-        int preference = preferenceOf(line);
-        for (const auto& t : types)
-            if (t != "pref" && !t.empty()) carrier.add("TYPE", t);
-        for (const auto& p : line.parameters) {
-            bool said = p.name == "TYPE" || p.name == "VALUE" || p.name == "ENCODING" || p.name == "PREF" ||
-                        p.name == "X-ROLVANE-LABEL" ||
-                        (p.name == "CC" && field.property == std::string_view(kCXAddressProperty));
-            if (said) continue;
-            carrier.parameters.push_back(p);
-            needed = true;
-        }
-        if (preference < 1000) carrier.add("PREF", std::to_string(preference)), needed = true;
-        auto raw = needed ? vcardEncodeMultiValue(field.property, value) : std::nullopt;
-        if (!raw) return;
-        if (keptGroup(line)) carrier.group = line.group;
-        carrier.add("X-ROLVANE-LABEL", label);
-        carrier.value = *raw;
-        _extras.push_back("+" + vcardFormatLine(carrier));
+    bool takeHomePage(const VCardLine& line) {
+        std::string address = vcardUnescape(line.value);
+        if (vcardTrim(address).empty()) return true;
+        if (_entity.properties[kCXHomePageProperty]) return false;
+        _entity.properties.set(kCXHomePageProperty, address);
+        return true;
+    }
+
+    bool takeSingle(const VCardLine& line) {
+        if (_entity.isGroup && line.name != "NOTE") return false;
+        const char* property = vcardTextPropertyForLine(line.name);
+        if (property) return takeText(line, property, vcardLineForTextProperty(property));
+        if (line.name == "FN") return takeText(line, kCXFormattedNameProperty, "FN");
+        Dictionary said;
+        if (line.name == "N")
+            vcardDecodeName(line, said);
+        else if (line.name == "ORG")
+            vcardDecodeOrganization(line, said);
+        else if (line.name == "NICKNAME")
+            vcardDecodeNickname(line, said);
+        else if (line.name == "BDAY")
+            decodeBirthday(line, said);
+        else
+            return false;
+        if (said.empty()) return vcardSurplusParts(line).empty();
+        if (!_seen.insert(line.name).second) return false;
+        for (const auto& [key, value] : said) _entity.properties.set(key, value);
+        return carrySingle(line, line.name);
+    }
+
+    bool takeText(const VCardLine& line, const char* property, const char* writtenName) {
+        if (vcardTrim(line.value).empty()) return true;
+        if (_entity.properties[property]) return false;
+        _entity.properties.set(property, vcardUnescape(line.value));
+        return carrySingle(line, writtenName);
+    }
+
+    static void decodeBirthday(const VCardLine& line, Dictionary& said) {
+        if (vcardTrim(line.value).empty()) return;
+        bool isText = vcardEqualNoCase(line.firstValueOf("VALUE"), "text");
+        auto date = isText ? std::nullopt : vcardDecodeDate(line.value);
+        if (date)
+            said.set(kCXBirthdayProperty, *date);
+        else
+            said.set(kCXBirthdayTextProperty, vcardUnescape(line.value));
+    }
+
+    // The value of such a line is written anew, so its carrier is finished when all is read.
+    bool carrySingle(const VCardLine& line, std::string writtenName) {
+        use(line.group);
+        if (saysMore(line)) _singleCarriers.emplace_back(&line, std::move(writtenName));
+        return true;
+    }
+
+    static bool saysMore(const VCardLine& line) {
+        return !line.group.empty() || !line.parameters.empty() || !vcardSurplusParts(line).empty();
+    }
+
+    // Parameters of any line that are used up or written anew.
+    static bool isSpent(const VCardParameter& p) {
+        return p.name == "VALUE" || p.name == "ENCODING" || p.name == "X-ROLVANE-REST";
+    }
+
+    // How many written lines a group name holds together, their labels aside.
+    void use(const std::string& group) {
+        if (!group.empty()) _groupUse[group]++;
     }
 
     // The group name holds the line together with others that are not just its label.
@@ -226,59 +265,17 @@ private:
         return use != _groupUse.end() && use->second > 1;
     }
 
-    bool takeSingle(const VCardLine& line) {
-        if (_entity.isGroup && line.name != "NOTE") return false;
-        Dictionary& p = _entity.properties;
-        bool empty = vcardTrim(line.value).empty();
-        auto once = [&](bool taken) { return empty || (!taken && _seen.insert({line.name, &line}).second); };
-        if (line.name == "N") {
-            if (!once(_seen.count("N"))) return false;
-            vcardDecodeName(line, p);
-            return carrySingle(line), true;
+    // Labels of nothing that has one, and further labels of what has one already.
+    void keepUnusedLabels() {
+        for (const VCardLine* line : _labelLines) {
+            bool said = _usedLabels.count(line->group) && _labels[line->group] == vcardUnescape(line->value);
+            if (!said) keep(*line);
         }
-        if (line.name == "ORG") {
-            if (!once(_seen.count("ORG"))) return false;
-            vcardDecodeOrganization(line, p);
-            return carrySingle(line), true;
-        }
-        if (line.name == "NICKNAME") {
-            if (!once(_seen.count("NICKNAME"))) return false;
-            std::string all;
-            for (const auto& n : vcardDecodeList(line)) (all += all.empty() ? "" : ", ") += n;
-            if (!all.empty()) p.set(kCXNicknameProperty, all);
-            return carrySingle(line), true;
-        }
-        if (line.name == "BDAY") return once(_seen.count("BDAY")) && takeBirthday(line, empty);
-        const char* property = textPropertyFor(line.name);
-        if (!property) return false;
-        if (empty) return true;
-        if (p[property]) return false;
-        p.set(property, vcardUnescape(line.value));
-        _seen.insert({line.name, &line});
-        return carrySingle(line), true;
-    }
-
-    bool takeBirthday(const VCardLine& line, bool empty) {
-        if (empty) return true;
-        bool isText = vcardEqualNoCase(line.firstValueOf("VALUE"), "text");
-        auto date = isText ? std::nullopt : vcardDecodeDate(line.value);
-        if (date)
-            _entity.properties.set(kCXBirthdayProperty, *date);
-        else
-            _entity.properties.set(kCXBirthdayTextProperty, vcardUnescape(line.value));
-        return true;
-    }
-
-    // The value of such a line is written anew, so its carrier is finished when all is read: see storeExtras.
-    void carrySingle(const VCardLine& line) {
-        bool needed = keptGroup(line);
-        for (const auto& p : line.parameters) needed = needed || (p.name != "VALUE" && p.name != "ENCODING");
-        if (needed) _singleCarriers.push_back(&line);
     }
 
     bool takeExactValue(const VCardLine& line) {
         std::string name = line.firstValueOf("X-NAME");
-        if (name.empty() || isForbidden(name)) return true;
+        if (name.empty() || vcardIsNeverExact(name)) return true;
         _exact.push_back({name, &line});
         return true;
     }
@@ -320,43 +317,121 @@ private:
         return std::any_of(_exact.begin(), _exact.end(), [&](const auto& e) { return e.first == property; });
     }
 
-    std::string writtenValue(const VCardLine& line) const {
-        const Dictionary& p = _entity.properties;
-        if (line.name == "N") return vcardEncodeName(p);
-        if (line.name == "ORG") return vcardEncodeOrganization(p);
-        return vcardEscape(vcardUnescape(line.value));
+    void finishSingleCarriers() {
+        for (const auto& [line, name] : _singleCarriers) {
+            VCardLine carrier;
+            if (keptGroup(*line)) carrier.group = line->group;
+            carrier.name = name;
+            for (const auto& p : line->parameters)
+                if (!isSpent(p) && !(name == "PHOTO" && p.name == "TYPE")) carrier.parameters.push_back(p);
+            addSurplus(*line, carrier);
+            if (carrier.group.empty() && carrier.parameters.empty()) continue;
+            carrier.value = vcardEncodeSingle(name, _entity.properties, _entity.isGroup);
+            if (!carrier.value.empty()) _extras.push_back("+" + vcardFormatLine(carrier));
+        }
+    }
+
+    static bool addSurplus(const VCardLine& line, VCardLine& carrier) {
+        std::string surplus = vcardSurplusParts(line);
+        if (!surplus.empty()) carrier.add("X-ROLVANE-REST", surplus);
+        return !surplus.empty();
+    }
+
+    // What a line says besides its value and label; nothing when that is all.
+    std::optional<VCardLine> carrierOf(const MultiCarrier& from, bool withPreference) const {
+        const VCardLine& line = *from.line;
+        VCardLine carrier;
+        carrier.name = from.field->lineName;
+        auto types = line.types();
+        bool needed = keptGroup(line) || vcardTypesAddToLabel(from.field->lineName, from.label, types);
+        for (const auto& t : types)
+            if (t != "pref" && !t.empty()) carrier.add("TYPE", t);
+        for (const auto& p : line.parameters) {
+            bool said = isSpent(p) || p.name == "TYPE" || p.name == "PREF" || p.name == "X-ROLVANE-LABEL" ||
+                        (p.name == "CC" && from.field->property == std::string_view(kCXAddressProperty));
+            if (said) continue;
+            carrier.parameters.push_back(p);
+            needed = true;
+        }
+        if (addSurplus(line, carrier)) needed = true;
+        int preference = preferenceOf(line);
+        if (withPreference && preference < kNoPreference)
+            carrier.add("PREF", std::to_string(preference)), needed = true;
+        if (!needed) return std::nullopt;
+        if (keptGroup(line)) carrier.group = line.group;
+        carrier.add("X-ROLVANE-LABEL", from.label);
+        return carrier;
+    }
+
+    void finishMultiCarriers() {
+        std::map<std::string_view, std::vector<const MultiCarrier*>> ofExact;
+        for (const auto& from : _multiCarriers) {
+            if (isExact(from.field->property))
+                ofExact[from.field->property].push_back(&from);
+            else
+                carry(from, vcardEncodeMultiValue(from.field->property, from.value), true);
+        }
+        for (auto& [property, all] : ofExact) finishExactCarriers(property, all);
+    }
+
+    void carry(const MultiCarrier& from, std::optional<std::string> raw, bool withPreference) {
+        auto carrier = raw ? carrierOf(from, withPreference) : std::nullopt;
+        if (!carrier) return;
+        carrier->value = std::move(*raw);
+        _extras.push_back("+" + vcardFormatLine(*carrier));
+    }
+
+    // An exact value has the last word on what entries there are and on their order, which a preference must fit.
+    void finishExactCarriers(std::string_view property, std::vector<const MultiCarrier*>& all) {
+        auto multi = CXMultiValue::fromValue(_entity.properties[property]);
+        if (!multi) return;
+        std::stable_sort(all.begin(), all.end(), [](const MultiCarrier* a, const MultiCarrier* b) {
+            return preferenceOf(*a->line) < preferenceOf(*b->line);
+        });
+        int last = 0;
+        for (const auto& entry : multi->entries()) {
+            auto raw = vcardEncodeMultiValue(property, entry.value);
+            if (!raw || !vcardIsPlainText(entry.label)) continue;
+            auto own = std::find_if(all.begin(), all.end(), [&](const MultiCarrier* c) {
+                return c->label == entry.label && c->value == entry.value;
+            });
+            int preference = own == all.end() ? kNoPreference : preferenceOf(*(*own)->line);
+            bool fits = preference >= last;
+            last = fits ? preference : kNoPreference;
+            if (own == all.end()) continue;
+            carry(**own, std::move(raw), fits);
+            all.erase(own);
+        }
     }
 
     void storeExtras() {
-        for (const VCardLine* line : _singleCarriers) {
-            VCardLine carrier;
-            if (keptGroup(*line)) carrier.group = line->group;
-            carrier.name = line->name;
-            for (const auto& p : line->parameters)
-                if (p.name != "VALUE" && p.name != "ENCODING") carrier.parameters.push_back(p);
-            carrier.value = line->name == "NICKNAME" ? vcardEncodeList(vcardDecodeList(*line)) : writtenValue(*line);
-            _extras.push_back("+" + vcardFormatLine(carrier));
-        }
+        finishSingleCarriers();
+        finishMultiCarriers();
         if (_extras.empty()) return;
         std::sort(_extras.begin(), _extras.end());
-        _extras.erase(std::unique(_extras.begin(), _extras.end()), _extras.end());
         Array all;
         all.reserve(_extras.size());
         for (auto& e : _extras) all.append(std::move(e));
         _entity.properties.set(kCXVCardExtraProperty, all);
     }
 
-    void keep(const VCardLine& line) { _extras.push_back(vcardFormatLine(line)); }
+    void keep(const VCardLine& line) {
+        use(line.group);
+        _extras.push_back(vcardFormatLine(line));
+    }
 
     const VCard& _card;
     VCardError& _error;
     VCardEntity _entity;
     std::map<std::string, std::string, std::less<>> _labels; // group name -> custom label
-    std::map<std::string, int, std::less<>> _groupUse;       // group name -> lines that are no labels
+    std::set<std::string, std::less<>> _usedLabels;          // group names
+    std::vector<const VCardLine*> _labelLines;
+    std::map<std::string, int, std::less<>> _groupUse;
     std::map<std::string, std::vector<Entry>, std::less<>> _multi;
-    std::map<std::string, const VCardLine*, std::less<>> _seen;
+    std::set<std::string, std::less<>> _seen;
     std::vector<std::pair<std::string, const VCardLine*>> _exact;
-    std::vector<const VCardLine*> _singleCarriers;
+    std::vector<std::pair<const VCardLine*, std::string>> _singleCarriers; // with the names that are written
+    std::vector<MultiCarrier> _multiCarriers;
     std::vector<std::string> _extras;
 };
 

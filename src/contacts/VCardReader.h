@@ -24,10 +24,14 @@ struct VCardChoice {
 // identifiers; names of CATEGORIES are in `categories`, not among the properties. For a group they are those of
 // CXGroup, and the four lists say who is in it.
 //
-// What a person's dictionary has no place for is kept under kCXVCardExtraProperty, sorted:
-// - a content line, unfolded, is written again as it stands ("X-COLOUR:red", "UID:…" of a card whose UID is no UUID);
+// What the dictionary has no place for is kept under kCXVCardExtraProperty, sorted:
+// - a content line, unfolded, is written again as it stands ("X-COLOUR:red", "UID:…" of a card whose UID is no UUID).
+//   Where it would be taken for something else, because the property that it stood behind is gone, it is written as the
+//   text of an X-ROLVANE-KEPT, from which reading takes it out again ("X-ROLVANE-KEPT:NICKNAME:Jack");
 // - a content line behind "+" carries parameters and the group of a line that the dictionary does express
-//   ("+TEL;TYPE=car;PREF=1;X-ROLVANE-LABEL=Car:+44 1"); it is used as long as that value and label are there.
+//   ("+TEL;TYPE=car;PREF=1;X-ROLVANE-LABEL=Car:+44 1"); it is used as long as that value and label are there. The value
+//   is the one that is written (a PHOTO's: vcardEncodeSingle); parts behind those of an ADR or N are its parameter
+//   X-ROLVANE-REST.
 struct VCardEntity {
     bool isGroup = false;
     std::string uid; // UID text as in the card, "" for none

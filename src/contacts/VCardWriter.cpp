@@ -9,6 +9,7 @@
 
 #include <algorithm>
 #include <set>
+#include <utility>
 
 namespace rolvane {
 
@@ -19,23 +20,13 @@ constexpr const char* kMultiOrder[] = {kCXPhoneProperty,     kCXEmailProperty,  
                                        kCXURLsProperty,      kCXInstantMessageProperty, kCXRelatedNamesProperty,
                                        kCXOtherDatesProperty};
 
-constexpr std::pair<const char*, const char*> kTextLines[] = {
-    {"TITLE", kCXJobTitleProperty},
-    {"NOTE", kCXNoteProperty},
-    {"X-ROLVANE-MAIDEN-NAME", kCXMaidenNameProperty},
-    {"X-ROLVANE-PHONETIC-FIRST", kCXFirstNamePhoneticProperty},
-    {"X-ROLVANE-PHONETIC-MIDDLE", kCXMiddleNamePhoneticProperty},
-    {"X-ROLVANE-PHONETIC-LAST", kCXLastNamePhoneticProperty},
+constexpr const char* kTextOrder[] = {
+    kCXJobTitleProperty,           kCXNoteProperty,
+    kCXMaidenNameProperty,         kCXFirstNamePhoneticProperty,
+    kCXMiddleNamePhoneticProperty, kCXLastNamePhoneticProperty,
 };
 
-// Never compared, because they are written by rules of their own, or never written at all.
-bool isOutsideTheCheck(std::string_view property) {
-    for (auto p :
-         {kCXVCardExtraProperty, kCXCategoriesProperty, kCXRemoteLocationProperty, kCXReadSharingACLProperty,
-          kCXReadWriteSharingACLProperty, kCXUIDProperty, kCXCreationDateProperty, kCXModificationDateProperty})
-        if (property == p) return true;
-    return false;
-}
+constexpr int kNoPreference = 1000;
 
 bool sameProperty(const Value& a, const Value& b) {
     auto ma = CXMultiValue::fromValue(a), mb = CXMultiValue::fromValue(b);
@@ -49,11 +40,10 @@ public:
 
     std::string text() {
         readExtras();
-        if (_entity.isGroup)
-            writeGroup();
-        else
-            writePerson();
-        for (const auto& line : _plain) emit(line);
+        do {
+            compose();
+            readBack();
+        } while (wrapWhatMeansSomethingElse());
         writeInexact();
         std::string out = "BEGIN:VCARD\r\nVERSION:";
         out += _v4 ? "4.0\r\n" : "3.0\r\n";
@@ -68,6 +58,52 @@ private:
         bool used = false;
     };
 
+    void compose() {
+        _lines.clear();
+        for (auto& c : _carriers) c.used = false;
+        _labelled.clear();
+        _groupCount = 0;
+        _anniversary = false;
+        if (_entity.isGroup)
+            writeGroup();
+        else
+            writePerson();
+        for (const auto& line : _plain)
+            if (_wrapped.count(line.name))
+                emit("X-ROLVANE-KEPT", vcardEscape(vcardFormatLine(line)));
+            else
+                emit(line);
+    }
+
+    void readBack() {
+        VCard card;
+        for (const auto& line : _lines) {
+            auto again = vcardParseLine(vcardFormatLine(line));
+            if (again) card.lines.push_back(std::move(*again));
+        }
+        VCardError error;
+        _back = vcardEntityFromCard(card, error);
+    }
+
+    // A kept line may stand beside a property that is no longer there, and would be taken for it. Such lines go inside
+    // an X-ROLVANE-KEPT, all of a name together. True when the text must be made anew.
+    bool wrapWhatMeansSomethingElse() {
+        if (_plain.empty()) return false;
+        std::multiset<std::string> kept;
+        bool readable = _back && _back->isGroup == _entity.isGroup;
+        if (const Array* extras = readable ? _back->properties[kCXVCardExtraProperty].arrayIf() : nullptr)
+            for (const auto& e : *extras) kept.insert(e.string());
+        size_t before = _wrapped.size();
+        for (const auto& line : _plain) {
+            auto found = kept.find(vcardFormatLine(line));
+            if (found != kept.end())
+                kept.erase(found);
+            else if (line.name != "UID" && line.name != "X-ROLVANE-KEPT")
+                _wrapped.insert(line.name);
+        }
+        return _wrapped.size() > before;
+    }
+
     void readExtras() {
         const Array* extras = _p[kCXVCardExtraProperty].arrayIf();
         for (size_t i = 0; extras && i < extras->count(); i++) {
@@ -79,7 +115,10 @@ private:
             if (!line || structural) continue;
             if (!line->group.empty()) _groupNames.insert(line->group);
             if (!carrier) {
-                if (line->name == "UID") _uidKept = true;
+                // A card has one UID, and one that can be read.
+                if (line->name == "UID" && (line->isStillEncoded() || std::exchange(_uidKept, true))) continue;
+                if (vcardIsLabelLine(*line)) _labelledBesides.insert(line->group);
+                if (line->isStillEncoded()) _wrapped.insert(line->name);
                 _plain.push_back(std::move(*line));
                 continue;
             }
@@ -87,6 +126,15 @@ private:
             std::erase_if(line->parameters, [](const VCardParameter& p) { return p.name == "X-ROLVANE-LABEL"; });
             _carriers.push_back({std::move(*line), std::move(label), false});
         }
+        // Of equal entries the preferred one comes first.
+        std::stable_sort(_carriers.begin(), _carriers.end(), [](const Carrier& a, const Carrier& b) {
+            return preferenceOf(a.line) < preferenceOf(b.line);
+        });
+    }
+
+    static int preferenceOf(const VCardLine& line) {
+        const VCardParameter* p = line.parameter("PREF");
+        return !p || p->values.empty() ? kNoPreference : std::atoi(p->values.front().c_str());
     }
 
     void emit(VCardLine line) { _lines.push_back(std::move(line)); }
@@ -98,16 +146,27 @@ private:
         emit(std::move(line));
     }
 
-    // A line of which a person has one, with the parameters that it came with.
-    void emitSingle(const char* name, std::string raw) {
+    // A line of which a card has one, with the parameters that it came with.
+    void emitSingle(const char* name, bool evenEmpty = false) {
+        VCardLine line = single(name);
+        if (evenEmpty || !line.value.empty()) emit(std::move(line));
+    }
+
+    VCardLine single(const char* name) {
         VCardLine line;
         line.name = name;
-        line.value = std::move(raw);
-        if (Carrier* c = carrierFor(line, "")) {
-            line.parameters = c->line.parameters;
-            line.group = c->line.group;
-        }
-        emit(std::move(line));
+        line.value = vcardEncodeSingle(name, _p, _entity.isGroup);
+        if (const Carrier* c = carrierFor(line, "")) take(*c, line);
+        return line;
+    }
+
+    static void take(const Carrier& carrier, VCardLine& line) {
+        line.group = carrier.line.group;
+        line.parameters = carrier.line.parameters;
+        const VCardParameter* rest = line.parameter("X-ROLVANE-REST");
+        if (!rest) return;
+        line.value += ';' + line.firstValueOf("X-ROLVANE-REST");
+        std::erase_if(line.parameters, [](const VCardParameter& p) { return p.name == "X-ROLVANE-REST"; });
     }
 
     Carrier* carrierFor(const VCardLine& line, const std::string& label) {
@@ -143,14 +202,12 @@ private:
     void writePerson() {
         emitUID();
         if (_p[kCXIsCompanyProperty].boolean()) emit(_v4 ? "KIND" : "X-ROLVANE-KIND", "org");
-        std::string formatted = plain(kCXFormattedNameProperty);
-        emitSingle("FN", vcardEscape(formatted.empty() ? vcardDerivedFormattedName(_p) : formatted));
-        std::string name = vcardEncodeName(_p);
-        if (!_v4 || name != ";;;;") emitSingle("N", name);
-        std::string nickname = plain(kCXNicknameProperty);
-        if (!nickname.empty()) emitSingle("NICKNAME", encodeNickname(nickname));
-        std::string organization = vcardEncodeOrganization(_p);
-        if (!organization.empty()) emitSingle("ORG", organization);
+        emitSingle("FN", true);
+        VCardLine name = single("N");
+        if (name.value.empty() && !_v4) name.value = ";;;;";
+        if (!name.value.empty()) emit(std::move(name));
+        emitSingle("NICKNAME");
+        emitSingle("ORG");
         for (const char* property : kMultiOrder) writeMulti(property);
         writeBirthday();
         std::string homePage = plain(kCXHomePageProperty);
@@ -161,34 +218,17 @@ private:
             line.value = vcardEncodeURI(homePage);
             emit(std::move(line));
         }
-        for (const auto& [lineName, property] : kTextLines) {
-            std::string text = plain(property);
-            if (!text.empty()) emitSingle(lineName, vcardEscape(text));
-        }
+        for (const char* property : kTextOrder) emitSingle(vcardLineForTextProperty(property));
         emitCategories();
         writePhoto();
     }
 
-    static std::string encodeNickname(const std::string& nickname) {
-        std::vector<std::string> items;
-        for (size_t start = 0; start != std::string::npos;) {
-            size_t end = nickname.find(", ", start);
-            items.push_back(nickname.substr(start, end == std::string::npos ? end : end - start));
-            start = end == std::string::npos ? end : end + 2;
-        }
-        return vcardEncodeList(items);
-    }
-
     void writeBirthday() {
-        VCardLine line;
-        line.name = "BDAY";
-        if (auto date = _p[kCXBirthdayProperty].date()) {
+        VCardLine line = single("BDAY");
+        if (auto date = _p[kCXBirthdayProperty].date())
             line.value = vcardEncodeDate(*date, _v4);
-        } else {
-            std::string text = plain(kCXBirthdayTextProperty);
-            if (!_v4 || !vcardIsTruncatedDate(text)) line.add("VALUE", "text");
-            line.value = vcardEscape(text);
-        }
+        else if (!_v4 || !vcardIsTruncatedDate(line.value))
+            line.add("VALUE", "text");
         if (!line.value.empty()) emit(std::move(line));
     }
 
@@ -197,7 +237,15 @@ private:
         if (bytes.empty()) return;
         std::string type = plain(kCXPhotoTypeProperty);
         bool usable = type.find('/') != std::string::npos && type.find_first_of(" ;,:\"\t\n\\") == std::string::npos;
-        emit(vcardEncodePhoto({bytes, usable ? type : std::string()}, _v4));
+        VCardLine line = vcardEncodePhoto({bytes, usable ? type : std::string()}, _v4);
+        bool parameters =
+            std::any_of(_carriers.begin(), _carriers.end(), [](const auto& c) { return c.line.name == "PHOTO"; });
+        if (parameters) {
+            VCardLine known = single("PHOTO");
+            line.group = known.group;
+            line.parameters.insert(line.parameters.end(), known.parameters.begin(), known.parameters.end());
+        }
+        emit(std::move(line));
     }
 
     void writeMulti(const char* property) {
@@ -216,8 +264,7 @@ private:
         line.value = *raw;
         const Carrier* carrier = carrierFor(line, entry.label);
         if (carrier) {
-            line.parameters = carrier->line.parameters;
-            line.group = carrier->line.group;
+            take(*carrier, line);
         } else {
             for (auto& t : vcardTypesForLabel(field.lineName, entry.label)) line.add("TYPE", t);
             if (field.lineName == std::string_view("EMAIL") && !_v4) line.add("TYPE", "internet");
@@ -228,12 +275,15 @@ private:
             if (!code.empty()) line.add("CC", code);
         }
         nameFor(line, field, entry.label);
-        bool saidByName = line.name == "ANNIVERSARY";
+        bool saidByName = line.name.ends_with("ANNIVERSARY");
         bool saidByTypes = vcardLabelForTypes(field.lineName, line.types()) == entry.label;
         bool related = line.name == "RELATED";
         if (related) line.parameters.insert(line.parameters.begin(), {"VALUE", {"text"}});
-        if (saidByName || saidByTypes) return emit(std::move(line));
+        // Another label of the group must not be taken for this one.
+        bool contested = !line.group.empty() && _labelledBesides.count(line.group);
+        if ((saidByName || saidByTypes) && !contested) return emit(std::move(line));
         if (line.group.empty()) line.group = freshGroup();
+        if (!_labelled.insert(line.group).second) return emit(std::move(line));
         VCardLine label;
         label.group = line.group;
         label.name = "X-ROLVANE-LABEL";
@@ -244,9 +294,8 @@ private:
 
     void nameFor(VCardLine& line, const VCardMultiField& field, const std::string& label) {
         bool anniversary = field.property == std::string_view(kCXOtherDatesProperty) && label == kCXAnniversaryLabel;
-        if (anniversary && _v4 && !_anniversary) {
-            line.name = "ANNIVERSARY";
-            _anniversary = true;
+        if (anniversary) {
+            line.name = _v4 && !std::exchange(_anniversary, true) ? "ANNIVERSARY" : "X-ANNIVERSARY";
         } else if (_v4 ? !field.inVersion4 : !field.inVersion3) {
             line.name = std::string("X-ROLVANE-") + field.lineName;
         }
@@ -256,10 +305,10 @@ private:
     void placePreference(VCardLine& line, int& preference) const {
         auto p = std::find_if(line.parameters.begin(), line.parameters.end(),
                               [](const auto& q) { return q.name == "PREF"; });
-        int own = p == line.parameters.end() || p->values.empty() ? 1000 : std::atoi(p->values.front().c_str());
+        int own = preferenceOf(line);
         bool fits = own >= preference;
-        preference = fits ? own : 1000;
-        if (own == 1000) return;
+        preference = fits ? own : kNoPreference;
+        if (own == kNoPreference) return;
         if (!fits || (!_v4 && own == 1)) line.parameters.erase(p);
         if (fits && !_v4 && own == 1) line.add("TYPE", "pref");
     }
@@ -274,11 +323,9 @@ private:
     void writeGroup() {
         emitUID();
         emit(_v4 ? "KIND" : "X-ROLVANE-KIND", "group");
-        std::string name = vcardEscape(plain(kCXGroupNameProperty));
-        emit("FN", name);
-        if (!_v4) emit("N", name + ";;;;");
-        std::string note = plain(kCXNoteProperty);
-        if (!note.empty()) emitSingle("NOTE", vcardEscape(note));
+        emitSingle("FN", true);
+        if (!_v4) emit("N", vcardEncodeSingle("FN", _p, true) + ";;;;");
+        emitSingle("NOTE");
         for (const auto& m : _entity.members) emit(_v4 ? "MEMBER" : "X-ROLVANE-MEMBER", vcardEscape(m));
         for (const auto& g : _entity.subgroups) emit("X-ROLVANE-SUBGROUP", vcardEscape(g));
         for (const auto& c : _entity.choices) {
@@ -292,23 +339,16 @@ private:
         }
     }
 
-    // Reads what has been written, and adds the exact value of every property that would not come back as it is.
+    // Adds the exact value of every property that does not come back as it is.
     void writeInexact() {
-        VCard card;
-        for (const auto& line : _lines) {
-            auto again = vcardParseLine(vcardFormatLine(line));
-            if (again) card.lines.push_back(std::move(*again));
-        }
-        VCardError error;
-        auto again = vcardEntityFromCard(card, error);
-        Dictionary back = again ? again->properties : Dictionary();
+        Dictionary back = _back ? _back->properties : Dictionary();
         std::set<std::string> names;
         for (const auto& [key, value] : _p)
             if (!sameProperty(value, back[key])) names.insert(key);
         for (const auto& [key, value] : back)
             if (!_p[key]) names.insert(key);
         for (const auto& name : names) {
-            if (isOutsideTheCheck(name) || !vcardIsPlainText(name)) continue;
+            if (vcardIsNeverExact(name) || !vcardIsPlainText(name)) continue;
             VCardLine line;
             line.name = "X-ROLVANE-VALUE";
             line.add("X-NAME", name);
@@ -323,6 +363,10 @@ private:
     std::vector<VCardLine> _lines, _plain;
     std::vector<Carrier> _carriers;
     std::set<std::string> _groupNames;
+    std::set<std::string> _labelledBesides; // groups with a kept line that would label them
+    std::set<std::string> _labelled;        // groups whose label is written
+    std::set<std::string> _wrapped;         // names of the kept lines that cannot stand for themselves
+    std::optional<VCardEntity> _back;       // the lines as they read again
     int _groupCount = 0;
     bool _uidKept = false, _anniversary = false;
 };

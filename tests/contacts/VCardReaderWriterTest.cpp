@@ -240,7 +240,7 @@ TEST(VCardWriter, WritesWhatEachVersionAsksFor) {
          {"BEGIN:VCARD\r\nVERSION:3.0\r\n", "UID:urn:uuid:00000000-0000-4000-8000-000000000001\r\n", "FN:Ann Lee\r\n",
           "N:Lee;Ann;;;\r\n", "TEL;TYPE=home,voice:+44 20 7946 0001\r\n", "item1.TEL:+44 20 7946 0002\r\n",
           "item1.X-ROLVANE-LABEL:Ski hut\r\n", "EMAIL;TYPE=work,internet:a@example.org\r\n", "BDAY:1985-04-12\r\n",
-          "PHOTO;ENCODING=b;TYPE=JPEG:/9j/\r\n", "X-ROLVANE-DATE:19850412\r\n", "END:VCARD\r\n"})
+          "PHOTO;ENCODING=b;TYPE=JPEG:/9j/\r\n", "X-ANNIVERSARY:19850412\r\n", "END:VCARD\r\n"})
         EXPECT_TRUE(contains(three, part)) << part << "\n" << three;
     for (const char* part :
          {"BEGIN:VCARD\r\nVERSION:4.0\r\n", "BDAY:19850412\r\n", "PHOTO:data:image/jpeg;base64,/9j/\r\n",

@@ -1,0 +1,280 @@
+// Cards as other programs write them, and as damage makes them: what was read is written so that it reads as the same
+// again, in both versions, parameters, groups and lines of unknown meaning included.
+
+#include "VCardGenerators.h"
+
+#include "contacts/VCardFields.h"
+#include "contacts/VCardText.h"
+#include "foundation/PropertyList.h"
+
+#include <gtest/gtest.h>
+
+namespace rolvane {
+namespace {
+
+using namespace vcardtest;
+
+VCardEntity readOne(const std::string& lines, const std::string& version = "4.0") {
+    auto r = readText("BEGIN:VCARD\r\nVERSION:" + version + "\r\n" + lines + "END:VCARD\r\n");
+    for (const auto& e : r.errors) ADD_FAILURE() << e.description();
+    return r.entities.size() == 1 ? r.entities[0] : VCardEntity{};
+}
+
+std::vector<std::string> extras(const VCardEntity& e) {
+    std::vector<std::string> all;
+    for (const auto& v : e.properties[kCXVCardExtraProperty].array()) all.push_back(v.string());
+    return all;
+}
+
+using Lines = std::vector<std::string>;
+
+void expectComesBack(const VCardEntity& e) {
+    for (auto version : {VCardVersion::v3, VCardVersion::v4}) {
+        std::string text = vcardText(e, version);
+        auto again = readText(text);
+        for (const auto& error : again.errors) ADD_FAILURE() << error.description() << "\n" << text;
+        ASSERT_EQ(again.entities.size(), 1u) << text;
+        const VCardEntity& b = again.entities[0];
+        EXPECT_EQ(withoutIdentifiers(b.properties), withoutIdentifiers(e.properties))
+            << text << description(b.properties) << description(e.properties);
+        EXPECT_EQ(b.isGroup, e.isGroup) << text;
+        EXPECT_EQ(b.categories, e.categories) << text;
+        EXPECT_EQ(b.members, e.members) << text;
+    }
+}
+
+bool bothVersionsContain(const VCardEntity& e, const std::string& part) {
+    return vcardText(e, VCardVersion::v3).find(part) != std::string::npos &&
+           vcardText(e, VCardVersion::v4).find(part) != std::string::npos;
+}
+
+std::string exactLine(const std::string& property, const Value& value) {
+    return "X-ROLVANE-VALUE;X-NAME=" + property + ":" + vcardEncodeBase64(BinaryValue::encode(value)) + "\r\n";
+}
+
+TEST(VCardLossless, EqualLinesKeepTheParametersOfEach) {
+    auto e = readOne("FN:x\r\nTEL;X-A=1:5\r\nTEL;X-A=1:5\r\n");
+    EXPECT_EQ(extras(e), (Lines{"+TEL;X-A=1;X-ROLVANE-LABEL=\"\":5", "+TEL;X-A=1;X-ROLVANE-LABEL=\"\":5"}));
+    expectComesBack(e);
+}
+
+TEST(VCardLossless, AnUnknownLineThatStandsTwiceStaysTwice) {
+    auto e = readOne("FN:x\r\nX-PET:cat\r\nX-PET:cat\r\n");
+    EXPECT_EQ(extras(e), (Lines{"X-PET:cat", "X-PET:cat"}));
+    expectComesBack(e);
+}
+
+TEST(VCardLossless, EqualValuesOfDifferentPreferenceKeepTheirParameters) {
+    auto e = readOne("FN:x\r\nTEL;PREF=2;X-A=1:5\r\nTEL;PREF=1;X-B=1:5\r\n");
+    EXPECT_EQ(extras(e).size(), 2u);
+    expectComesBack(e);
+}
+
+TEST(VCardLossless, ALineWithNothingInItLeavesThePlaceToTheNext) {
+    auto e = readOne("FN:x\r\nNICKNAME:,\r\nNICKNAME:Jim\r\nORG: ;\r\nORG:Mill\r\nN:;;;;\r\nN:Lee;Ann;;;\r\n");
+    EXPECT_EQ(e.properties[kCXNicknameProperty].string(), "Jim");
+    EXPECT_EQ(e.properties[kCXOrganizationProperty].string(), "Mill");
+    EXPECT_EQ(e.properties[kCXLastNameProperty].string(), "Lee");
+    EXPECT_EQ(extras(e), Lines{});
+    expectComesBack(e);
+}
+
+TEST(VCardLossless, ALabelOfALineThatHasNoneIsKept) {
+    auto e = readOne("FN:x\r\nitem1.X-PET:cat\r\nitem1.X-ABLABEL:Tom\r\n");
+    EXPECT_EQ(extras(e), (Lines{"item1.X-ABLABEL:Tom", "item1.X-PET:cat"}));
+    expectComesBack(e);
+}
+
+TEST(VCardLossless, AFurtherLabelOfAGroupIsKeptAndDoesNotBecomeTheLabel) {
+    auto e = readOne("FN:x\r\nitem1.TEL;TYPE=home:1\r\nitem1.X-PET:cat\r\nitem1.X-ABLABEL:Home\r\n"
+                     "item1.X-OTHERLABEL:Cabin\r\n");
+    EXPECT_EQ(CXMultiValue::fromValue(e.properties[kCXPhoneProperty])->labelAtIndex(0), "Home");
+    EXPECT_EQ(extras(e),
+              (Lines{"+item1.TEL;TYPE=home;X-ROLVANE-LABEL=Home:1", "item1.X-OTHERLABEL:Cabin", "item1.X-PET:cat"}));
+    expectComesBack(e);
+}
+
+TEST(VCardLossless, OneLabelServesAllLinesOfItsGroup) {
+    auto e = readOne("FN:x\r\nitem1.TEL:1\r\nitem1.TEL:2\r\nitem1.X-ABLABEL:Cabin\r\n");
+    for (auto version : {VCardVersion::v3, VCardVersion::v4}) {
+        std::string text = vcardText(e, version);
+        size_t at = text.find("item1.X-ROLVANE-LABEL:Cabin\r\n");
+        ASSERT_NE(at, std::string::npos) << text;
+        EXPECT_EQ(text.find("X-ROLVANE-LABEL", at + 10), std::string::npos) << text;
+    }
+    expectComesBack(e);
+}
+
+TEST(VCardLossless, AGroupNameCountsOnlyTheLinesThatAreWrittenAgain) {
+    auto e = readOne("FN:x\r\nitem1.TEL:1\r\nitem1.PRODID:a program\r\n");
+    EXPECT_EQ(extras(e), Lines{});
+    expectComesBack(e);
+}
+
+TEST(VCardLossless, AnAnniversaryLeavesTheOtherLinesOfItsGroupUnlabelled) {
+    auto e = readOne("FN:x\r\nitem1.ANNIVERSARY:19850412\r\nitem1.TEL;TYPE=car:1\r\n");
+    EXPECT_FALSE(bothVersionsContain(e, "X-ROLVANE-VALUE")) << vcardText(e, VCardVersion::v3);
+    EXPECT_TRUE(vcardText(e, VCardVersion::v3).find("item1.X-ANNIVERSARY:19850412\r\n") != std::string::npos);
+    expectComesBack(e);
+}
+
+TEST(VCardLossless, ParametersOfATextByAForeignNameAreWrittenUnderOurs) {
+    auto e = readOne("FN:x\r\nX-MAIDENNAME;LANGUAGE=en:Lee\r\n", "3.0");
+    EXPECT_TRUE(bothVersionsContain(e, "X-ROLVANE-MAIDEN-NAME;LANGUAGE=en:Lee\r\n"));
+    expectComesBack(e);
+}
+
+TEST(VCardLossless, ParametersOfABirthdayAreKept) {
+    auto full = readOne("FN:x\r\nBDAY;VALUE=date;X-OMIT-YEAR=1604:1604-04-12\r\n", "3.0");
+    EXPECT_NE(vcardText(full, VCardVersion::v3).find("BDAY;X-OMIT-YEAR=1604:1604-04-12\r\n"), std::string::npos);
+    EXPECT_NE(vcardText(full, VCardVersion::v4).find("BDAY;X-OMIT-YEAR=1604:16040412\r\n"), std::string::npos);
+    expectComesBack(full);
+    auto text = readOne("FN:x\r\nBDAY;VALUE=text;LANGUAGE=fr:vers 1800\r\n");
+    EXPECT_TRUE(bothVersionsContain(text, "BDAY;LANGUAGE=fr;VALUE=text:vers 1800\r\n"));
+    expectComesBack(text);
+}
+
+TEST(VCardLossless, ABirthdayInTheYearNoughtIsText) {
+    auto e = readOne("FN:x\r\nBDAY:00000412\r\nBDAY:19850412\r\n");
+    EXPECT_EQ(e.properties[kCXBirthdayTextProperty].string(), "00000412");
+    EXPECT_EQ(extras(e), Lines{"BDAY:19850412"});
+    expectComesBack(e);
+}
+
+TEST(VCardLossless, ANicknameWithACommaOfItsOwnKeepsItsParameters) {
+    auto e = readOne("FN:x\r\nNICKNAME;LANGUAGE=en:a\\, \\, b\r\n");
+    EXPECT_TRUE(bothVersionsContain(e, "NICKNAME;LANGUAGE=en:a\\, \\, b\r\n"));
+    expectComesBack(e);
+}
+
+TEST(VCardLossless, ACountryCodeWithBlanksCostsTheAddressNothing) {
+    auto e = readOne("FN:x\r\nADR;LABEL=front;CC=\" GB\":;;S;;;;\r\n");
+    EXPECT_TRUE(bothVersionsContain(e, "ADR;LABEL=front;CC=\" GB\":;;S;;;;\r\n"));
+    expectComesBack(e);
+}
+
+TEST(VCardLossless, PartsBeyondTheKnownOnesOfAddressAndNameAreKept) {
+    auto e =
+        readOne("FN:x\r\nN:Lee;Ann;;;;Garcia\\;x;II\r\nADR;TYPE=home:;;S;C;;;;room 3;;floor\\, 2\r\nADR:;;T;;;;;;\r\n");
+    EXPECT_TRUE(bothVersionsContain(e, "N:Lee;Ann;;;;Garcia\\;x;II\r\n"));
+    EXPECT_TRUE(bothVersionsContain(e, "ADR;TYPE=home:;;S;C;;;;room 3;;floor\\, 2\r\n"));
+    EXPECT_TRUE(bothVersionsContain(e, "ADR:;;T;;;;\r\n"));
+    expectComesBack(e);
+    auto nothingElse = readOne("N:;;;;;Garcia\r\n");
+    EXPECT_EQ(extras(nothingElse), Lines{"N:;;;;;Garcia"});
+    expectComesBack(nothingElse);
+}
+
+TEST(VCardLossless, ParametersOfAPhotoAreKeptUntilItIsAnotherPhoto) {
+    auto e =
+        readOne("FN:x\r\nitem1.PHOTO;ENCODING=b;TYPE=PNG;X-CROP=\"1,2\":iVBORw0KGgo=\r\nitem1.X-PET:cat\r\n", "3.0");
+    EXPECT_TRUE(vcardText(e, VCardVersion::v3).find("item1.PHOTO;ENCODING=b;TYPE=PNG;X-CROP=\"1,2\":iVBORw0KGgo=") !=
+                std::string::npos);
+    EXPECT_TRUE(vcardText(e, VCardVersion::v4).find("item1.PHOTO;X-CROP=\"1,2\":data:image/png;base64,iVBO") !=
+                std::string::npos);
+    expectComesBack(e);
+    e.properties.set(kCXPhotoProperty, Bytes{1, 2, 3});
+    EXPECT_EQ(vcardText(e, VCardVersion::v4).find("X-CROP"), std::string::npos);
+}
+
+TEST(VCardLossless, ASecondHomePageIsKept) {
+    auto e = readOne("FN:x\r\nURL;X-ROLVANE-HOMEPAGE=1:http://a.test\r\nURL;X-ROLVANE-HOMEPAGE=1:http://b.test\r\n");
+    EXPECT_EQ(e.properties[kCXHomePageProperty].string(), "http://a.test");
+    EXPECT_EQ(extras(e), Lines{"URL;X-ROLVANE-HOMEPAGE=1:http://b.test"});
+    expectComesBack(e);
+}
+
+TEST(VCardLossless, AGroupKeepsFurtherNamesTheirParametersAndItsCategories) {
+    auto e = readOne("KIND:group\r\nFN;LANGUAGE=en:Choir\r\nFN;LANGUAGE=de:Chor\r\nCATEGORIES:Music\r\n");
+    EXPECT_EQ(e.properties[kCXGroupNameProperty].string(), "Choir");
+    EXPECT_EQ(extras(e), (Lines{"+FN;LANGUAGE=en:Choir", "CATEGORIES:Music", "FN;LANGUAGE=de:Chor"}));
+    expectComesBack(e);
+}
+
+// --- lines beside properties that are no longer there ----------------------------------------------------------------
+
+TEST(VCardLossless, AKeptLineIsNotTakenForAPropertyThatThePersonRemoved) {
+    auto e = readOne("FN:Ann\r\nFN:Anna\r\nN:;Ann;;;\r\nNICKNAME:Jim\r\nNICKNAME:Jack\r\nNICKNAME:Joe\r\n");
+    for (const char* property : {kCXNicknameProperty, kCXFirstNameProperty}) e.properties.remove(property);
+    for (auto version : {VCardVersion::v3, VCardVersion::v4}) {
+        std::string text = vcardText(e, version);
+        EXPECT_NE(text.find("X-ROLVANE-KEPT:NICKNAME:Jack\r\n"), std::string::npos) << text;
+        EXPECT_NE(text.find("X-ROLVANE-KEPT:FN:Anna\r\n"), std::string::npos) << text;
+        EXPECT_EQ(text.find("X-ROLVANE-VALUE"), std::string::npos) << text;
+    }
+    expectComesBack(e);
+}
+
+TEST(VCardLossless, AKeptLineNeverMakesAPersonAGroup) {
+    VCardEntity e;
+    e.properties = {{kCXFirstNameProperty, "Ann"},
+                    {kCXVCardExtraProperty, Array{"CATEGORIES:Work", "KIND:group", "PHOTO;ENCODING=b:!!"}}};
+    expectComesBack(e);
+}
+
+TEST(VCardLossless, AKeptLineOfAnUnknownCharacterSetDoesNotMakeTheCardUnreadable) {
+    VCardEntity e;
+    e.properties = {{kCXFirstNameProperty, "Ann"}, {kCXVCardExtraProperty, Array{"X-PET;CHARSET=none:cat"}}};
+    for (auto version : {VCardVersion::v3, VCardVersion::v4}) {
+        auto again = readText(vcardText(e, version));
+        ASSERT_EQ(again.entities.size(), 1u) << vcardText(e, version);
+        EXPECT_EQ(extras(again.entities[0]), Lines{"X-ROLVANE-KEPT:X-PET\\;CHARSET=none:cat"});
+        expectComesBack(again.entities[0]);
+    }
+}
+
+TEST(VCardLossless, AWrappedLineCannotEndTheCardOrSayWhoseItIs) {
+    for (std::string inner : {"UID:other", "END:VCARD", "BEGIN:VCARD", "VERSION:2.1", "no line", "X-ROLVANE-KEPT:A:b",
+                              "A;CHARSET=none:b", "A;ENCODING=QUOTED-PRINTABLE:b="}) {
+        inner = vcardEscape(inner);
+        auto e = readOne("UID:mine\r\nFN:x\r\nX-ROLVANE-KEPT:" + inner + "\r\n");
+        EXPECT_EQ(e.uid, "mine");
+        EXPECT_EQ(extras(e), (Lines{"UID:mine", "X-ROLVANE-KEPT:" + inner}));
+        expectComesBack(e);
+    }
+}
+
+TEST(VCardLossless, ACardHasOneUIDEvenWhenTwoWereKept) {
+    VCardEntity e;
+    e.properties = {{kCXFirstNameProperty, "Ann"},
+                    {kCXVCardExtraProperty, Array{"UID;CHARSET=none:c", "UID:a", "UID:b"}}};
+    for (auto version : {VCardVersion::v3, VCardVersion::v4}) {
+        auto again = readText(vcardText(e, version));
+        ASSERT_EQ(again.entities.size(), 1u);
+        EXPECT_EQ(again.entities[0].uid, "a");
+        EXPECT_EQ(extras(again.entities[0]), Lines{"UID:a"});
+    }
+}
+
+// --- exact values ----------------------------------------------------------------------------------------------------
+
+TEST(VCardLossless, AnExactValueTakesTheParametersOfItsLineOver) {
+    auto e = readOne("FN:x\r\nNICKNAME;LANGUAGE=en:Jim\r\n" + exactLine(kCXNicknameProperty, Value("Bob")));
+    EXPECT_EQ(e.properties[kCXNicknameProperty].string(), "Bob");
+    EXPECT_EQ(extras(e), Lines{"+NICKNAME;LANGUAGE=en:Bob"});
+    expectComesBack(e);
+}
+
+TEST(VCardLossless, AnExactValueDropsTheParametersOfWhatItDoesNotHold) {
+    CXMutableMultiValue phones;
+    phones.addValue("1", "");
+    phones.addValue("2", "");
+    phones.addValue(Value(7), "");
+    auto e = readOne("FN:x\r\nTEL;PREF=1;X-B=1:2\r\nTEL;X-A=1:1\r\nTEL;X-C=1:3\r\n" +
+                     exactLine(kCXPhoneProperty, phones.toValue()));
+    EXPECT_EQ(extras(e), (Lines{"+TEL;X-A=1;X-ROLVANE-LABEL=\"\":1", "+TEL;X-B=1;X-ROLVANE-LABEL=\"\":2"}))
+        << "a preference that contradicts the order goes too";
+    expectComesBack(e);
+}
+
+TEST(VCardLossless, ACardSetsNothingThatIsWrittenByRulesOfItsOwn) {
+    for (const char* property : {kCXUIDProperty, kCXCreationDateProperty, kCXModificationDateProperty,
+                                 kCXCategoriesProperty, kCXVCardExtraProperty}) {
+        auto e = readOne("FN:x\r\n" + exactLine(property, Array{"X-PET:cat"}));
+        EXPECT_FALSE(e.properties[property]) << property;
+        expectComesBack(e);
+    }
+}
+
+} // namespace
+} // namespace rolvane
