@@ -8,6 +8,7 @@
 
 #include <gtest/gtest.h>
 
+#include <filesystem>
 #include <fstream>
 #include <map>
 #include <sstream>
@@ -512,6 +513,24 @@ TEST(VCardRoundTrip, HostileTextsSurviveTheDatabaseAndBothVersions) {
         group->addMember(p);
     }
     db->save();
+    Value before = wholeOf(*db);
+    for (auto version : {VCardVersion::v3, VCardVersion::v4}) {
+        TestDatabase copy;
+        auto report = importText(*copy, exportAll(*db, version));
+        EXPECT_EQ(report.errorCount, 0u) << errorsOf(report);
+        EXPECT_EQ(firstDifference(before, wholeOf(*copy)), "");
+    }
+}
+
+TEST(VCardRoundTrip, OddAndDamagedCardsSurviveTheDatabaseAndBothVersions) {
+    TestDatabase db;
+    size_t cards = 0;
+    for (const char* directory : {"/fuzz/corpus/vcard", "/fuzz/regressions/vcard"})
+        for (const auto& entry : std::filesystem::directory_iterator(std::string(ROLVANE_SOURCE_DIR) + directory)) {
+            auto report = VCardImport::importFile(*db, entry.path());
+            cards += report.imported + report.groups;
+        }
+    EXPECT_GT(cards, 40u);
     Value before = wholeOf(*db);
     for (auto version : {VCardVersion::v3, VCardVersion::v4}) {
         TestDatabase copy;
