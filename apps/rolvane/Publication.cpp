@@ -126,7 +126,7 @@ void forgetPublication(Preferences& preferences) {
     EngineState state(preferences);
     for (const char* conduit : {kConduitCX, kConduitVaultra})
         state.conduitObjectForKey(conduit, "priorState").remove(kSelf.str());
-    preferences.remove(kDaemonDomain, kCXDUnsavedAccessLists);
+    for (const char* note : {kCXDUnsavedAccessLists, kCXDUnderWay}) preferences.remove(kDaemonDomain, note);
     dropPending(state, [](const CXDChangeRecord& record) { return record.changeMadeByDataOwner(); });
     state.syncPrefs();
 }

@@ -136,12 +136,12 @@ void ApplyLoop::applyAll(bool trickle) {
     const size_t fresh = _unhandled.size();
     append(_unhandled, _parts.state.getPendingChanges());
     _queueTaken = true;
-    _formerlyUnderWay = _parts.state.underWay(); // of a pass that was killed
+    _underWay = _parts.state.underWay(); // of a pass that was killed, or what an earlier one left adrift
     _unsettled = unsettledGroups(_unhandled, fresh);
     withdrawWhatIsGone(_unhandled, fresh, _parts.with.rolvane);
-    if (!_formerlyUnderWay.empty())
+    if (!_underWay->empty())
         _parts.state.withConduitData(
-            [&](Dictionary& data) { settleUnderWay(_formerlyUnderWay, _unhandled, data, _parts.with.rolvane); });
+            [&](Dictionary& data) { settleUnderWay(*_underWay, _unhandled, data, _parts.with.rolvane); });
     queue();
     _parts.with.progress.startedPhase(3);
     split();
@@ -180,15 +180,18 @@ void ApplyLoop::split() {
         (record->canApplyOutOfOrder() ? outOfOrder : _inOrder).push_back(std::move(record));
     _unhandled.clear();
     const Dictionary now = underWay(outOfOrder);
+    _underWay = underWayTogether(*_underWay, now);
+    _end.removed = removedBy(outOfOrder);
     _outOfOrder = std::make_unique<OutOfOrderWork>(_parts, std::move(outOfOrder));
-    if (!now.empty()) noteUnderWay(now);
+    if (!now.empty()) noteUnderWay();
 }
 
 // What cannot be noted is done all the same: a full disk does not keep the store out of step.
-void ApplyLoop::noteUnderWay(const Dictionary& now) {
+void ApplyLoop::noteUnderWay() {
     try {
         claimState();
-        _parts.state.setUnderWay(underWayTogether(_formerlyUnderWay, now));
+        _parts.state.setUnderWay(*_underWay);
+        _parts.with.preferences.synchronize(kDaemonDomain);
     } catch (const CXException& e) {
         CXLog("applyChangeRecords: Caught %@: %@", e.name(), e.reason());
     }
@@ -342,6 +345,9 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
     _parts.state.putConduitData();
     _parts.state.setPendingChanges(_pendingChanges);
     _queueStored = true;
+    _end.unsureGroups = groupsOf(_pendingChanges);
+    for (const auto& [group, isSo] : _unsettled)
+        _end.unsureGroups.insert(cxUIDWithTableName(UniqueId(group), kCXGroupTable));
     const bool lookAgain = noteUnsettled() && _pendingChanges.empty();
     _pendingChanges.clear();
     for (const CXDChangeRecordPtr& record : _parts.denied.all()) _parts.conduits.vaultra->wasRefused(*record);
@@ -379,7 +385,7 @@ void ApplyLoop::bumpShareCount() {
     try {
         preferences.set(kDaemonDomain, kCXDLastOstrelUser, user ? Value(*user) : Value());
         _parts.state.putConduitData();
-        if (_queueStored) _parts.state.removeUnderWay();
+        if (_queueStored && _underWay) _parts.state.setUnderWay(adrift(*_underWay, _parts.state.conduitData(), _end));
         _parts.with.rolvane.bumpShareCount(preferences);
         preferences.synchronize(kDaemonDomain);
     } catch (const CXException& e) {

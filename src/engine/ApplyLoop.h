@@ -1,6 +1,7 @@
 #pragma once
 
 #include "engine/EngineParts.h"
+#include "engine/UnderWay.h"
 #include "model/CXDChangeRecord.h"
 
 #include <exception>
@@ -41,7 +42,7 @@ private:
     CXDChangeRecords accepted();
     bool noteSwallowed(const CXDChangeRecord& record);
     void split();
-    void noteUnderWay(const Dictionary& now);
+    void noteUnderWay();
     void applyOutOfOrder();
     void applyInOrder();
     void applyInOrder(const CXDChangeRecordPtr& record);
@@ -63,7 +64,8 @@ private:
     bool _queueStored = false;
     CXDChangeRecords _pendingChanges;
     Dictionary _unsettled; // groups whose changes may have been lost, or applied in another order than they were made
-    Dictionary _formerlyUnderWay;
+    std::optional<Dictionary> _underWay; // none: the note of it was not read yet, and stays as it is
+    PassEnd _end;
     CXDChangeRecords _inOrder;
     size_t _inOrderDone = 0;
     bool _arrivalsNoted = false; // for a save in the middle of the pass

@@ -125,17 +125,12 @@ void EngineState::setPendingChanges(const CXDChangeRecords& records) {
     _preferences.synchronize(kDaemonDomain);
 }
 
-void EngineState::removeUnderWay() {
-    _preferences.remove(kDaemonDomain, kCXDUnderWay);
-}
-
 Dictionary EngineState::underWay() const {
     return _preferences.get(kDaemonDomain, kCXDUnderWay).dictionary();
 }
 
 void EngineState::setUnderWay(const Dictionary& underWay) {
-    _preferences.set(kDaemonDomain, kCXDUnderWay, underWay);
-    _preferences.synchronize(kDaemonDomain);
+    _preferences.set(kDaemonDomain, kCXDUnderWay, underWay.empty() ? Value() : Value(underWay));
 }
 
 void EngineState::noteRefusedChanges(const CXDChangeRecords& records, Date when) {

@@ -62,8 +62,7 @@ public:
 
     // What a pass is about to put on the store: from before its first write, durably, to its very end.
     Dictionary underWay() const;
-    void setUnderWay(const Dictionary& underWay);
-    void removeUnderWay(); // without synchronising
+    void setUnderWay(const Dictionary& underWay); // without synchronising; empty: removes it
 
     // Adds what a pass was refused; the oldest are forgotten. Without synchronising.
     void noteRefusedChanges(const CXDChangeRecords& records, Date when);

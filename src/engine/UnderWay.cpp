@@ -9,6 +9,7 @@
 #include "model/PayloadKeys.h"
 #include "model/RemoteLocationMap.h"
 
+#include <algorithm>
 #include <array>
 #include <string_view>
 #include <unordered_map>
@@ -37,7 +38,8 @@ std::string shared(const UniqueId& uid, std::string_view table) {
 }
 
 void addEach(Array to, const Value& elements) {
-    for (const Value& element : elements.array()) to.append(element);
+    for (const Value& element : elements.array())
+        if (!to.contains(element)) to.append(element);
 }
 
 // Where a change of one member or subgroup belongs; none for other changes.
@@ -70,6 +72,7 @@ public:
         : _conduitData(conduitData), _known(knownGroups(conduitData)), _rolvane(rolvane), _holdings(rolvane) {
         for (const CXDChangeRecordPtr& record : records)
             if (record->group() && isOwnWrite(*record)) _gathered.insert(shared(*record->group(), kCXGroupTable));
+        _withdrawn = removedBy(records);
     }
 
     void person(const UniqueId& uid) {
@@ -79,6 +82,7 @@ public:
     }
 
     void group(const UniqueId& uid, const Dictionary& touched) {
+        if (_withdrawn.contains(uid)) return; // and a change beside that would be folded with it into one that is none
         const bool isAll = uid.str() == kCXAllGroupUID;
         const CXGroupRef there =
             isAll ? _rolvane.allGroup() : std::dynamic_pointer_cast<CXGroup>(_rolvane.recordForUniqueId(uid));
@@ -157,9 +161,35 @@ private:
     CXRolvane& _rolvane;
     Holdings _holdings;
     std::unordered_set<std::string> _gathered, _gone, _renamed;
+    std::unordered_set<UniqueId> _withdrawn;
     std::unordered_map<std::string, std::unordered_set<std::string>> _decided; // by group, its members and subgroups
     CXDChangeRecords _records;
 };
+
+// Who and what is not in both lists of all that are known.
+void addUnlisted(Dictionary& left, const Dictionary& underWay, const Dictionary& conduitData,
+                 const std::unordered_set<UniqueId>& removed) {
+    const Dictionary touchedGroups = underWay[kGroups].dictionary();
+    if (removed.contains(UniqueId(kCXAllGroupUID))) return;
+    std::array<Dictionary, 2> lists;
+    bool listed = true;
+    for (size_t i = 0; const char* conduit : {kConduitCX, kConduitVaultra}) {
+        const Dictionary groups = conduitData[conduit].dictionary()[kPriorState].dictionary()[kSelf.str()].dictionary();
+        listed = listed && groups.contains(kCXAllGroupUID);
+        lists[i++] = groups[kCXAllGroupUID].dictionary();
+    }
+    if (!listed && !touchedGroups.contains(kCXAllGroupUID)) return;
+    const auto isAdrift = [&](const std::string& name, const char* list) {
+        return !removed.contains(UniqueId(name)) && std::any_of(lists.begin(), lists.end(), [&](const Dictionary& all) {
+            return !all[list].array().containsString(name);
+        });
+    };
+    for (const Value& person : underWay[kPeople].array())
+        if (isAdrift(person.string(), kMemberUIDState)) left.arrayFor(kPeople).append(person);
+    for (const auto& [group, touched] : touchedGroups)
+        if (group == kCXAllGroupUID ? !listed : isAdrift(group, kSubgroupUIDState))
+            left.dictionaryFor(kGroups).dictionaryFor(group);
+}
 
 } // namespace
 
@@ -188,6 +218,34 @@ Dictionary underWayTogether(const Dictionary& former, const Dictionary& latter) 
         if (touched.dictionary()[kNamed].boolean()) group.set(kNamed, true);
     }
     return both;
+}
+
+std::unordered_set<UniqueId> removedBy(const CXDChangeRecords& records) {
+    std::unordered_set<UniqueId> removed;
+    for (const CXDChangeRecordPtr& record : records) {
+        if (!isOwnWrite(*record)) continue;
+        if (record->type() == CXDDeleteRecord && record->person())
+            removed.insert(cxUIDWithTableName(*record->person(), kCXPersonTable));
+        if (record->type() == CXDDeleteGroup && record->group())
+            removed.insert(cxUIDWithTableName(*record->group(), kCXGroupTable));
+    }
+    return removed;
+}
+
+std::unordered_set<UniqueId> groupsOf(const CXDChangeRecords& records) {
+    std::unordered_set<UniqueId> groups;
+    for (const CXDChangeRecordPtr& record : records)
+        if (record->group() && isOwnWrite(*record)) groups.insert(cxUIDWithTableName(*record->group(), kCXGroupTable));
+    return groups;
+}
+
+Dictionary adrift(const Dictionary& underWay, const Dictionary& conduitData, const PassEnd& end) {
+    Dictionary left;
+    for (const auto& [group, touched] : underWay[kGroups].dictionary())
+        if (end.unsureGroups.contains(UniqueId(group)) && !end.removed.contains(UniqueId(group)))
+            left.dictionaryFor(kGroups).set(group, touched);
+    addUnlisted(left, underWay, conduitData, end.removed);
+    return left;
 }
 
 void settleUnderWay(const Dictionary& underWay, CXDChangeRecords& records, Dictionary& conduitData,

@@ -4,6 +4,7 @@
 #include "model/CXDChangeRecord.h"
 
 #include <cstddef>
+#include <unordered_set>
 
 namespace rolvane {
 
@@ -26,5 +27,19 @@ Dictionary underWayTogether(const Dictionary& former, const Dictionary& latter);
 // the pass has gathered and the queue; and those are taken out by which the store would bring the same back. Of groups
 // only those are spoken of that are shared still, which is to say that they are known or gathered.
 void settleUnderWay(const Dictionary& underWay, CXDChangeRecords& records, Dictionary& conduitData, CXRolvane& rolvane);
+
+// What is known at the end of a pass, identifiers in their shared form.
+struct PassEnd {
+    std::unordered_set<UniqueId> removed;      // people and groups that it took from the store, or has still to take
+    std::unordered_set<UniqueId> unsureGroups; // whose changes wait, or may have been lost
+};
+std::unordered_set<UniqueId> removedBy(const CXDChangeRecords& records);
+std::unordered_set<UniqueId> groupsOf(const CXDChangeRecords& records); // of the owner's own writes
+
+// What of it the next pass is to look at again, because no comparison would: what the pass was to do to the groups of
+// which that is not sure, and who or what is not in both lists of all that are known. Where a change of the list of all
+// was lost or waits, a contact that is on the store already could leave the database without anybody's noticing. Where
+// that list is not published, nothing is removed from the store one by one.
+Dictionary adrift(const Dictionary& underWay, const Dictionary& conduitData, const PassEnd& end);
 
 } // namespace rolvane

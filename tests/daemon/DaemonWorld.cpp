@@ -157,6 +157,8 @@ std::string DaemonWorld::differences() {
         found += fmt::format("{} members instead of {}\n", listed.count(), members.count());
     for (const Value& member : members)
         if (!listed.contains(member)) found += member.string() + " is not listed as a member\n";
+    for (const Value& member : listed)
+        if (!members.contains(member)) found += member.string() + " is listed and belongs to nobody\n";
     for (const CXGroupRef& group : database().allGroup()->subgroups()) found += groupDifferences(*group);
     return found;
 }
