@@ -3,8 +3,6 @@
 #include "contacts/Identifier.h"
 #include "engine/EngineState.h"
 #include "foundation/Paths.h"
-#include "model/PayloadKeys.h"
-#include "model/RemoteLocationMap.h"
 
 #include <csignal>
 #include <cstdlib>
