@@ -67,7 +67,6 @@ public:
     // copies of a third user. Kinds are checked too: what a member list calls a person and is none stays as it is.
     bool updateRecord(const CXDChangeRecordPtr& record);
     bool createStructureForGroup(const CXDChangeRecordPtr& record); // saves
-    void saveInThePass();
     bool changeGroupName(const CXDChangeRecordPtr& record);
     bool addRecordToGroup(const CXDChangeRecordPtr& record);
     bool addGroupToGroup(const CXDChangeRecordPtr& record);
@@ -128,6 +127,7 @@ private:
         Date since;
     };
 
+    void saveInThePass();
     Dictionary priorState() const;
     ChangeCapture newCapture() const;
     bool forgetWhatIsPublishedAgain(); // true: there is something

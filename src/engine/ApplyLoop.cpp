@@ -342,6 +342,7 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
         _parts.state.dropIntent(); // another save is to mean nothing of it
         throw;
     }
+    for (const CXDChangeRecordPtr& record : _parts.denied.all()) takeBack(*record);
     _parts.state.putConduitData();
     _parts.state.setPendingChanges(_pendingChanges);
     _queueStored = true;
@@ -350,7 +351,6 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
         _end.unsureGroups.insert(cxUIDWithTableName(UniqueId(group), kCXGroupTable));
     const bool lookAgain = noteUnsettled() && _pendingChanges.empty();
     _pendingChanges.clear();
-    for (const CXDChangeRecordPtr& record : _parts.denied.all()) _parts.conduits.vaultra->wasRefused(*record);
     CXDChangeRecords refused = _parts.denied.all();
     append(refused, _parts.state.takeRefused());
     if (!refused.empty()) _parts.state.noteRefusedChanges(refused, _parts.with.clock.now());
@@ -360,6 +360,20 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
     }
     _parts.conduits.cx->close();
     _parts.conduits.vaultra->close();
+}
+
+// What another user's store has refused is undone in the copy: contacts are read again, and a group counts as changed
+// there, so that the next comparison finds the store without the change.
+void ApplyLoop::takeBack(const CXDChangeRecord& record) {
+    _parts.conduits.vaultra->wasRefused(record);
+    if (record.initialSource() != CXDSyncSourceCX || record.changeMadeByDataOwner() || !record.user()) return;
+    if (!record.group()) return;
+    _parts.state.withConduitData([&](Dictionary& data) {
+        const Dictionary groups =
+            data[kConduitVaultra].dictionary()[kPriorState].dictionary()[record.user()->str()].dictionary();
+        if (groups.contains(cxUIDWithTableName(*record.group(), kCXGroupTable).str()))
+            updateCache(data, CXDSyncSourceVaultra, record);
+    });
 }
 
 // The next scan takes them from there. False when there are none.

@@ -54,6 +54,7 @@ private:
     void cleanUp();
     void carryOver();
     void storeAndClose(bool allowRetry);
+    void takeBack(const CXDChangeRecord& record);
     bool noteUnsettled();
     void bumpShareCount();
 

@@ -1,11 +1,14 @@
 #include "Neighbour.h"
 #include "contacts/CXRolvane.h"
+#include "contacts/Identifier.h"
 #include "contacts/SharingDates.h"
 #include "foundation/Date.h"
 #include "support/WaitUntil.h"
 
 #include <csignal>
 #include <filesystem>
+#include <map>
+#include <set>
 
 namespace rolvane::test {
 namespace {
@@ -281,6 +284,53 @@ TEST_F(Rights, AnEditThatCameTooLateIsRefusedToldAndLeavesTheQueue) {
     EXPECT_EQ(world.done({"show", "Ada"}).find("too late"), std::string::npos);
     bob.done({"sync"});
     EXPECT_EQ(bob.done({"show", "Ada"}).find("too late"), std::string::npos) << "the copy is the publisher's again";
+}
+
+// Name -> members, groups in it and choices, of the publisher's groups or of their copies.
+template <class Person>
+std::map<std::string, nlohmann::json> groupsOf(Person& user, const std::vector<std::string>& whose) {
+    std::vector<std::string> command{"group", "list"};
+    command.insert(command.end(), whose.begin(), whose.end());
+    std::map<std::string, nlohmann::json> all;
+    for (const nlohmann::json& group : user.json(command)) {
+        nlohmann::json& state = all[group["name"]];
+        for (const char* list : {"members", "subgroups"}) {
+            std::set<std::string> names;
+            for (const std::string uid : group[list]) names.insert(cxNormalizedUID(UniqueId(uid)).str());
+            state[list] = names;
+        }
+        for (const auto& [uid, choice] : group["distribution"].items())
+            state["choices"][cxNormalizedUID(UniqueId(uid)).str()] = choice;
+    }
+    return all;
+}
+
+TEST_F(Rights, ChangesOfGroupsThatCameTooLateAreTakenBackInTheCopy) {
+    world.group("Friends", {"Bea"});
+    world.group("Work", {});
+    world.done({"publish"});
+    world.done({"share", "bob", "--write"});
+    bob.done({"subscribe", "alice"});
+    const auto before = groupsOf(world, {"--own"});
+    ASSERT_EQ(groupsOf(bob, {"--of", "alice"}), before);
+    bob.done({"daemon", "stop"});
+    bob.done({"group", "rename", "Family", "Clan"});
+    bob.done({"group", "remove", "Friends", "Bea"});
+    bob.done({"group", "add", "Friends", "Ada"});
+    bob.done({"group", "add-group", "Clan", "Friends"});
+    bob.done({"delete", "--yes", "Ada"});
+    bob.done({"group", "delete", "Work"});
+    world.done({"share", "bob"});
+    bob.rolvane({"sync"});
+    EXPECT_GE(bob.json({"status"})["refused"].size(), 1U);
+    bob.done({"sync"});
+    EXPECT_EQ(groupsOf(world, {"--own"}), before);
+    EXPECT_EQ(groupsOf(bob, {"--of", "alice"}), before) << "the copies are the publisher's again";
+    EXPECT_NE(bob.done({"show", "Ada"}).find("Ada"), std::string::npos);
+    const auto refused = bob.json({"status"})["refused"].size();
+    bob.done({"sync"});
+    EXPECT_EQ(bob.json({"status"})["refused"].size(), refused) << "nothing is tried again";
+    EXPECT_EQ(bob.json({"status"})["pending"], 0);
 }
 
 } // namespace
