@@ -8,6 +8,7 @@
 #include "daemon/DaemonControl.h"
 #include "foundation/PropertyList.h"
 #include "store/CXDAVManager.h"
+#include "store/CXWebDAVLock.h"
 
 #include <fmt/format.h>
 
@@ -117,6 +118,7 @@ void unpublish(Context& context, const PublishOptions& options) {
     bool removed = false;
     try {
         if (!options.keep && !wholeListStays) {
+            releaseLocksOfEndedRuns(CXDAVManager::defaultManager()); // they keep files on the store
             if (nothingLeft) {
                 int code = 0;
                 removed = CXDAVManager::defaultManager().removeFileAtURL(base, &code);

@@ -2,9 +2,11 @@
 
 #include "TwoPeople.h"
 #include "foundation/PropertyList.h"
+#include "support/WaitUntil.h"
 
 #include <algorithm>
 #include <chrono>
+#include <filesystem>
 #include <functional>
 
 namespace rolvane::test {
@@ -185,6 +187,22 @@ TEST_F(KilledFirstPublication, LeavesNothingOnTheStoreOfWhoIsDeletedBeforeTheNex
     }
     cleanPass();
     expectTheStoreHoldsJustThat();
+}
+
+// Its lock stands on the tree, and no later pass would give it back.
+TEST_F(KilledFirstPublication, CanBeWithdrawnAtOnce) {
+    const auto daemon = world.startManager({"-p"});
+    const std::filesystem::path notes = world.home / "state/rolvane/locks";
+    const auto knowsItsLock = [&] {
+        std::error_code none;
+        for (const auto& note : std::filesystem::directory_iterator(notes, none))
+            if (contentsOf(note.path()).find("opaquelocktoken:") != std::string::npos) return true;
+        return false;
+    };
+    ASSERT_TRUE(waitUntil(knowsItsLock, "a lock of the pass")) << daemon->errors();
+    daemon->kill();
+    world.done({"unpublish"});
+    EXPECT_TRUE(world.tree().empty());
 }
 
 } // namespace
