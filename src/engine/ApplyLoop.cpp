@@ -1,6 +1,7 @@
 #include "engine/ApplyLoop.h"
 
 #include "contacts/CXRolvane.h"
+#include "contacts/Constants.h"
 #include "contacts/Identifier.h"
 #include "engine/Arrivals.h"
 #include "engine/ChangeQueue.h"
@@ -47,6 +48,22 @@ int64_t configuredWorkers(const NetworkAccount& account) {
     int64_t workers = kDefaultWorkers;
     const auto [end, error] = std::from_chars(text->data(), text->data() + text->size(), workers);
     return error == std::errc() && end == text->data() + text->size() ? workers : kDefaultWorkers;
+}
+
+// Without what waits for other trees, which have groups of the same names, and for sources that no pass writes to.
+Dictionary unsettledOwnGroups(const CXDChangeRecords& records, size_t fresh) {
+    if (records.size() <= fresh) return {};
+    const auto queue = records.begin() + static_cast<std::ptrdiff_t>(fresh);
+    CXDChangeRecords own = ownWrites({records.begin(), queue});
+    const size_t freshOwn = own.size();
+    append(own, ownWrites({queue, records.end()}));
+    return unsettledGroups(own, freshOwn);
+}
+
+// While only single groups are published, the list of locations is there and empty.
+bool publishesEverything(CXRolvane& rolvane) {
+    const auto locations = rolvane.allGroup()->multiValueForProperty(kCXRemoteLocationProperty);
+    return locations && !locations->empty();
 }
 
 // Tells the file managers what the apply loop is going to read, and that it has ended.
@@ -138,6 +155,7 @@ void ApplyLoop::applyAll(bool trickle) {
     _queueTaken = true;
     _underWay = _parts.state.underWay(); // of a pass that was killed, or what an earlier one left adrift
     _unsettled = unsettledGroups(_unhandled, fresh);
+    for (const auto& [group, isSo] : unsettledOwnGroups(_unhandled, fresh)) noteUnsure(UniqueId(group));
     withdrawWhatIsGone(_unhandled, fresh, _parts.with.rolvane);
     if (!_underWay->empty())
         _parts.state.withConduitData(
@@ -165,7 +183,10 @@ void ApplyLoop::queue() {
     CXDLog("Mingled: %@", accepted);
     std::unordered_set<UniqueId> lossy;
     CXDChangeRecords flat = flattenGroupChanges(accepted, &lossy);
-    for (const UniqueId& group : lossy) _unsettled.set(group.str(), true);
+    for (const UniqueId& group : lossy) {
+        _unsettled.set(group.str(), true);
+        noteUnsure(group);
+    }
     sortByType(flat);
     _totalCount = flat.size();
     _processedCount = 0;
@@ -287,6 +308,7 @@ bool ApplyLoop::noteSwallowed(const CXDChangeRecord& record) {
     if (!record.group() || record.group()->str() == kCXAllGroupUID) return false;
     if (!_parts.with.rolvane.recordForUniqueId(cxUIDWithTableName(*record.group(), kCXGroupTable))) return false;
     _unsettled.set(record.group()->str(), true);
+    noteUnsure(*record.group());
     return true;
 }
 
@@ -346,9 +368,8 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
     _parts.state.putConduitData();
     _parts.state.setPendingChanges(_pendingChanges);
     _queueStored = true;
-    _end.unsureGroups = groupsOf(_pendingChanges);
-    for (const auto& [group, isSo] : _unsettled)
-        _end.unsureGroups.insert(cxUIDWithTableName(UniqueId(group), kCXGroupTable));
+    _end.unsureGroups.merge(groupsOf(ownWrites(_pendingChanges)));
+    _end.everythingIsPublished = publishesEverything(rolvane);
     const bool lookAgain = noteUnsettled() && _pendingChanges.empty();
     _pendingChanges.clear();
     CXDChangeRecords refused = _parts.denied.all();
@@ -374,6 +395,10 @@ void ApplyLoop::takeBack(const CXDChangeRecord& record) {
         if (groups.contains(cxUIDWithTableName(*record.group(), kCXGroupTable).str()))
             updateCache(data, CXDSyncSourceVaultra, record);
     });
+}
+
+void ApplyLoop::noteUnsure(const UniqueId& group) {
+    _end.unsureGroups.insert(cxUIDWithTableName(group, kCXGroupTable));
 }
 
 // The next scan takes them from there. False when there are none.

@@ -55,6 +55,7 @@ private:
     void carryOver();
     void storeAndClose(bool allowRetry);
     void takeBack(const CXDChangeRecord& record);
+    void noteUnsure(const UniqueId& group); // one of the owner's
     bool noteUnsettled();
     void bumpShareCount();
 

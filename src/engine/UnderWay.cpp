@@ -232,10 +232,17 @@ std::unordered_set<UniqueId> removedBy(const CXDChangeRecords& records) {
     return removed;
 }
 
-std::unordered_set<UniqueId> groupsOf(const CXDChangeRecords& records) {
-    std::unordered_set<UniqueId> groups;
+CXDChangeRecords ownWrites(const CXDChangeRecords& records) {
+    CXDChangeRecords own;
     for (const CXDChangeRecordPtr& record : records)
-        if (record->group() && isOwnWrite(*record)) groups.insert(cxUIDWithTableName(*record->group(), kCXGroupTable));
+        if (isOwnWrite(*record)) own.push_back(record);
+    return own;
+}
+
+std::unordered_set<UniqueId> groupsOf(const CXDChangeRecords& ownWrites) {
+    std::unordered_set<UniqueId> groups;
+    for (const CXDChangeRecordPtr& record : ownWrites)
+        if (record->group()) groups.insert(cxUIDWithTableName(*record->group(), kCXGroupTable));
     return groups;
 }
 
@@ -244,7 +251,7 @@ Dictionary adrift(const Dictionary& underWay, const Dictionary& conduitData, con
     for (const auto& [group, touched] : underWay[kGroups].dictionary())
         if (end.unsureGroups.contains(UniqueId(group)) && !end.removed.contains(UniqueId(group)))
             left.dictionaryFor(kGroups).set(group, touched);
-    addUnlisted(left, underWay, conduitData, end.removed);
+    if (end.everythingIsPublished) addUnlisted(left, underWay, conduitData, end.removed);
     return left;
 }
 

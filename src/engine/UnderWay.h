@@ -32,14 +32,16 @@ void settleUnderWay(const Dictionary& underWay, CXDChangeRecords& records, Dicti
 struct PassEnd {
     std::unordered_set<UniqueId> removed;      // people and groups that it took from the store, or has still to take
     std::unordered_set<UniqueId> unsureGroups; // whose changes wait, or may have been lost
+    bool everythingIsPublished = false;        // and not single groups only
 };
 std::unordered_set<UniqueId> removedBy(const CXDChangeRecords& records);
-std::unordered_set<UniqueId> groupsOf(const CXDChangeRecords& records); // of the owner's own writes
+CXDChangeRecords ownWrites(const CXDChangeRecords& records); // the owner's, to the network store
+std::unordered_set<UniqueId> groupsOf(const CXDChangeRecords& ownWrites);
 
 // What of it the next pass is to look at again, because no comparison would: what the pass was to do to the groups of
 // which that is not sure, and who or what is not in both lists of all that are known. Where a change of the list of all
 // was lost or waits, a contact that is on the store already could leave the database without anybody's noticing. Where
-// that list is not published, nothing is removed from the store one by one.
+// single groups are published, that list says little, and nothing is removed from the store one by one.
 Dictionary adrift(const Dictionary& underWay, const Dictionary& conduitData, const PassEnd& end);
 
 } // namespace rolvane

@@ -1,5 +1,6 @@
 #include "EngineWorld.h"
 
+#include "contacts/Constants.h"
 #include "engine/EngineState.h"
 #include "engine/UnderWay.h"
 #include "model/PayloadKeys.h"
@@ -121,6 +122,30 @@ TEST_F(LeftAdrift, WithdrawingTheListOfAllEndsIt) {
     refused.clear();
     loseTheQueue();
     EXPECT_THAT(pass({own(CXDDeleteGroup, nullptr, kAll)}), UnorderedElementsAre("AllCXGroup 261", "P:CXPerson 260"));
+    EXPECT_FALSE(world.stored(kCXDUnderWay));
+}
+
+// Every subscriber's copy has a list of all, but that of single groups is nobody's list of who is published.
+TEST_F(LeftAdrift, NothingIsLeftOfAPassWhereSingleGroupsArePublished) {
+    world.rolvane->allGroup()->setValue(CXMultiValue(), kCXRemoteLocationProperty);
+    world.rolvane->addRecord(CXPerson::initWithUniqueId(UniqueId(kPerson)));
+    world.rolvane->save();
+    const Value name = Dictionary{{kCXGroupNameProperty, "Friends"}};
+    pass({own(CXDUpdateRecord, kPerson, nullptr), own(CXDCreateStructureForGroup, nullptr, kGroup, name),
+          own(CXDAddRecordToGroup, kPerson, kGroup)});
+    EXPECT_FALSE(world.stored(kCXDUnderWay));
+}
+
+// What waits for somebody else's list of all, or for a source that no pass writes to, can wait for ever.
+TEST_F(LeftAdrift, WhatWaitsElsewhereKeepsNothingOfTheOwnersOwn) {
+    world.vaultra->whenApplying = [](const CXDChangeRecordPtr& r, bool*) { return r->user() == kSelf; };
+    world.rolvane->addRecord(CXPerson::initWithUniqueId(UniqueId(kPerson)));
+    world.rolvane->save();
+    pass({makeRecord(CXDAddRecordToGroup, "B:CXPerson", kAll, {CXDSyncSourceCX, CXDSyncSourceVaultra, "bob"}),
+          makeRecord(CXDAddRecordToGroup, kPerson, kAll, {CXDSyncSourceCX, CXDSyncSourceLocal, "<self>"})});
+    EXPECT_EQ(world.pending().size(), 2U);
+    pass({own(CXDUpdateRecord, kPerson, nullptr), own(CXDAddRecordToGroup, kPerson, kAll)});
+    EXPECT_EQ(world.pending().size(), 2U);
     EXPECT_FALSE(world.stored(kCXDUnderWay));
 }
 
