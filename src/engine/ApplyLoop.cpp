@@ -157,6 +157,7 @@ void ApplyLoop::applyAll(bool trickle) {
     _unsettled = unsettledGroups(_unhandled, fresh);
     for (const auto& [group, isSo] : unsettledOwnGroups(_unhandled, fresh)) noteUnsure(UniqueId(group));
     withdrawWhatIsGone(_unhandled, fresh, _parts.with.rolvane);
+    dropRemovalsOfWhatIsBack(_unhandled, fresh, _parts.with.rolvane);
     if (!_underWay->empty())
         _parts.state.withConduitData(
             [&](Dictionary& data) { settleUnderWay(*_underWay, _unhandled, data, _parts.with.rolvane); });

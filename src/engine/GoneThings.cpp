@@ -3,6 +3,8 @@
 #include "engine/Holdings.h"
 #include "model/PayloadKeys.h"
 
+#include <algorithm>
+
 namespace rolvane {
 
 namespace {
@@ -59,6 +61,20 @@ void withdrawWhatIsGone(CXDChangeRecords& records, size_t fresh, CXRolvane& rolv
             withdrawMembers(record, holdings, removals);
     }
     for (CXDChangeRecordPtr& record : removals) records.push_back(std::move(record));
+}
+
+void dropRemovalsOfWhatIsBack(CXDChangeRecords& records, size_t fresh, CXRolvane& rolvane) {
+    const auto holds = [&](const UniqueId& uid, std::string_view table) {
+        return rolvane.recordForUniqueId(cxUIDWithTableName(uid, table)) != nullptr;
+    };
+    const auto isBack = [&](const CXDChangeRecordPtr& record) {
+        if (record->initialSource() != CXDSyncSourceCX || !record->changeMadeByDataOwner()) return false;
+        if (record->type() == CXDDeleteRecord) return record->person() && holds(*record->person(), kCXPersonTable);
+        return record->type() == CXDDeleteGroup && record->group() && record->group()->str() != kCXAllGroupUID &&
+               holds(*record->group(), kCXGroupTable);
+    };
+    const auto queue = records.begin() + static_cast<std::ptrdiff_t>(fresh);
+    records.erase(std::remove_if(queue, records.end(), isBack), records.end());
 }
 
 } // namespace rolvane

@@ -14,4 +14,8 @@ class CXRolvane;
 // new ones and then the queue, which alone is looked at.
 void withdrawWhatIsGone(CXDChangeRecords& records, size_t fresh, CXRolvane& rolvane);
 
+// And the other way round: what was to be removed from the store may be in the database again, an undone deletion or an
+// imported card. The waiting removal is behind the changes that bring it back, and would be taken for the later one.
+void dropRemovalsOfWhatIsBack(CXDChangeRecords& records, size_t fresh, CXRolvane& rolvane);
+
 } // namespace rolvane

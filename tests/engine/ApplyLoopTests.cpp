@@ -122,6 +122,30 @@ TEST_F(Pass, WhatWaitedAndIsGoneFromTheDatabaseIsWithdrawn) {
                                                    "Fresh:CXPerson 1"}));
 }
 
+TEST_F(Pass, ARemovalThatWaitedOfWhatIsInTheDatabaseAgainIsGivenUp) {
+    for (const char* uid : {"Back:CXPerson", "Theirs:CXPerson", "Copy:CXSubscribedPerson"})
+        world.rolvane->addRecord(CXPerson::initWithUniqueId(UniqueId(uid)));
+    world.rolvane->addRecord(CXGroup::initWithUniqueId(UniqueId("Back:CXGroup")));
+    world.rolvane->save();
+    const auto own = [](int32_t type, const char* person, const char* group, const char* user = "<self>") {
+        return makeRecord(type, person, group, {CXDSyncSourceCX, CXDSyncSourceVaultra, user});
+    };
+    world.engine->setPendingChanges(
+        {own(CXDDeleteRecord, "Back:CXPerson", nullptr), own(CXDDeleteRecord, "Copy:CXPerson", nullptr),
+         own(CXDDeleteRecord, "Gone:CXPerson", nullptr), own(CXDDeleteRecord, "Theirs:CXPerson", nullptr, "bob"),
+         own(CXDDeleteGroup, nullptr, "Back:CXGroup"), own(CXDDeleteGroup, nullptr, "AllCXGroup")});
+    std::mutex lock;
+    std::multiset<std::string> applied;
+    world.vaultra->whenApplying = [&](const CXDChangeRecordPtr& r, bool*) {
+        const std::lock_guard guard(lock);
+        applied.insert((r->person() ? r->person()->str() : r->group()->str()) + " " + std::to_string(r->type()));
+        return true;
+    };
+    trickle({own(CXDUpdateRecord, "Back:CXPerson", nullptr), own(CXDChangeGroupName, nullptr, "Back:CXGroup")});
+    EXPECT_EQ(applied, (std::multiset<std::string>{"Back:CXPerson 1", "Copy:CXPerson 260", "Gone:CXPerson 260",
+                                                   "Theirs:CXPerson 260", "Back:CXGroup 4", "AllCXGroup 261"}));
+}
+
 TEST_F(Pass, WhoWaitedToBeListedAndIsGoneFromTheDatabaseIsTakenOutAndRemoved) {
     const CXPersonRef kept = CXPerson::initWithUniqueId(UniqueId("Kept:CXPerson"));
     world.rolvane->addRecord(kept);
