@@ -217,12 +217,26 @@ void CXDCXConduit::captureDeleted(ChangeCapture& capture, const Array& identifie
     lookForRevokedSubscriptions(deleted);
     const RemovalChanges removals(priorState(), deleted.size());
     for (const UniqueId& identifier : deleted) {
-        if (rolvane().recordForUniqueId(identifier)) continue; // it is here again: another subscription brought it
         const UniqueId normalized = cxNormalizedUID(identifier);
+        if (rolvane().recordForUniqueId(identifier)) { // it is here again: undone, or another subscription brought it
+            if (identifier == normalized) captureWhatListed(capture, removals, identifier);
+            continue;
+        }
         if (normalized.endsWith(kCXGroupTable))
             capture.add(removals.changesToRemoveGroup(normalized));
         else if (normalized.endsWith(kCXPersonTable))
             capture.add(removals.changesToRemovePerson(normalized));
+    }
+}
+
+// The owner's groups that it was in: it came back without its places there.
+void CXDCXConduit::captureWhatListed(ChangeCapture& capture, const RemovalChanges& removals, const UniqueId& uid) {
+    const bool isGroup = uid.endsWith(kCXGroupTable);
+    for (const CXDChangeRecordPtr& removal :
+         isGroup ? removals.changesToRemoveGroup(uid) : removals.changesToRemovePerson(uid)) {
+        const int32_t type = removal->type();
+        if (removal->user() == kSelf && (type == CXDRemoveRecordFromGroup || type == CXDRemoveGroupFromGroup))
+            capture.addGroup(std::dynamic_pointer_cast<CXGroup>(rolvane().recordForUniqueId(*removal->group())));
     }
 }
 

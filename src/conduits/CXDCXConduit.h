@@ -20,6 +20,7 @@ class CXSubscription;
 class CXRecord;
 class CXRolvane;
 class ChangeCapture;
+class RemovalChanges;
 class Clock;
 class Preferences;
 
@@ -145,6 +146,7 @@ private:
     void captureInserted(ChangeCapture& capture, const Array& identifiers);
     void captureUpdated(ChangeCapture& capture, const Array& identifiers);
     void captureDeleted(ChangeCapture& capture, const Array& identifiers);
+    void captureWhatListed(ChangeCapture& capture, const RemovalChanges& removals, const UniqueId& uid);
 
     World _world;
     bool _readOnlyKillSwitch = false;

@@ -107,6 +107,28 @@ TEST_F(LiveChange, OfADeletedRecordIsSearchedUnderItsNormalisedIdentifier) {
                      "261 bob - G:CXGroup 4"}));
 }
 
+// It has left the owner's groups with the deletion. A copy has not been in anything of the owner's that says so.
+TEST_F(LiveChange, OfADeletedRecordThatIsHereAgainComparesTheOwnersGroupsThatListedIt) {
+    publishAll();
+    const auto ada = person("Ada", "A"), eve = person("Eve", "E"), bobs = subscribedPerson("Sub", "S");
+    const auto inner = group("I", {}, "I");
+    const auto friends = group("F", {ada, eve}, "F"), others = group("O", {ada}, "O"),
+               theirs = subscribedGroup("T", "T");
+    others->addSubgroup(inner);
+    save();
+    for (const auto& each : {friends, others, inner}) knows(UserName("<self>"), each);
+    engine.priorState("CXDCX").dictionaryFor("bob").set(
+        "T:CXGroup", Dictionary{{"memberUIDState", Array{"A:CXPerson", "S:CXPerson"}}});
+    friends->removeMember(ada);
+    save();
+    EXPECT_EQ(linesAfter(changed({}, {}, {ada->uniqueId()})),
+              (Texts{"258 <self> A:CXPerson F:CXGroup 4", "257 <self> A:CXPerson F:CXGroup 4"}));
+    others->removeSubgroup(inner);
+    save();
+    EXPECT_EQ(linesAfter(changed({}, {}, {inner->uniqueId()})), Texts{"259 <self> I:CXGroup O:CXGroup 4"});
+    EXPECT_EQ(linesAfter(changed({}, {}, {bobs->uniqueId()})), Texts{});
+}
+
 TEST_F(LiveChange, ThatDeletesManyRecordsIsWhatTheSingleSearchesGive) {
     Array members;
     Notification notification = changed({}, {}, {});
