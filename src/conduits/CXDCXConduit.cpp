@@ -171,6 +171,7 @@ void CXDCXConduit::rolvaneChanged(const Notification& notification) {
     ChangeCapture capture = newCapture();
     if (inserted.count() + updated.count() >= kMany) capture.reader().expectMany();
     captureInserted(capture, inserted);
+    captureReplaced(capture, inserted);
     captureUpdated(capture, updated);
     captureDeleted(capture, notification.userInfo[kCXDeletedRecords].array());
 
@@ -190,6 +191,19 @@ void CXDCXConduit::captureInserted(ChangeCapture& capture, const Array& identifi
         else
             capture.addGroup(std::dynamic_pointer_cast<CXGroup>(recordForUniqueId(uid)));
     }
+}
+
+// Of an own record that was removed and made anew in one save only the insertion is told.
+void CXDCXConduit::captureReplaced(ChangeCapture& capture, const Array& inserted) {
+    const Dictionary all = priorState()[kSelf.str()].dictionary()[layout::kAllGroup].dictionary();
+    const Array people = all[kMemberUIDState].array(), groups = all[kSubgroupUIDState].array();
+    std::vector<UniqueId> replaced;
+    for (const Value& identifier : inserted)
+        if (people.containsString(identifier.string()) || groups.containsString(identifier.string()))
+            replaced.emplace_back(identifier.string());
+    if (replaced.empty()) return;
+    const RemovalChanges removals(priorState(), replaced.size());
+    for (const UniqueId& uid : replaced) captureWhatListed(capture, removals, uid);
 }
 
 void CXDCXConduit::captureUpdated(ChangeCapture& capture, const Array& identifiers) {

@@ -144,6 +144,7 @@ private:
     // Has somebody else saved the record since this pass gathered its changes? That edit is still to be captured.
     bool hasUncapturedEdit(const UniqueId& uid);
     void captureInserted(ChangeCapture& capture, const Array& identifiers);
+    void captureReplaced(ChangeCapture& capture, const Array& inserted);
     void captureUpdated(ChangeCapture& capture, const Array& identifiers);
     void captureDeleted(ChangeCapture& capture, const Array& identifiers);
     void captureWhatListed(ChangeCapture& capture, const RemovalChanges& removals, const UniqueId& uid);

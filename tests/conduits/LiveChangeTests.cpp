@@ -129,6 +129,24 @@ TEST_F(LiveChange, OfADeletedRecordThatIsHereAgainComparesTheOwnersGroupsThatLis
     EXPECT_EQ(linesAfter(changed({}, {}, {bobs->uniqueId()})), Texts{});
 }
 
+TEST_F(LiveChange, OfARecordThatWasRemovedAndMadeAnewInOneSaveComparesTheGroupsThatListedIt) {
+    publishAll();
+    const auto ada = person("Ada", "A");
+    const auto inner = group("I", {}, "I"), friends = group("F", {ada}, "F");
+    friends->addSubgroup(inner);
+    save();
+    for (const CXGroupRef& each : {friends, inner, CXGroupRef(database.allGroup())}) knows(UserName("<self>"), each);
+    database.removeRecord(ada);
+    database.removeRecord(inner);
+    const auto again = person("Ada again", "A");
+    const auto innerAgain = group("I", {}, "I");
+    save();
+    EXPECT_EQ(linesAfter(changed({again->uniqueId()}, {}, {})),
+              (Texts{"1 <self> A:CXPerson - 4", "5 <self> A:CXPerson AllCXGroup 4", "258 <self> A:CXPerson F:CXGroup 4",
+                     "257 <self> A:CXPerson F:CXGroup 4", "259 <self> I:CXGroup F:CXGroup 4"}));
+    EXPECT_EQ(linesAfter(changed({innerAgain->uniqueId()}, {}, {})).back(), "259 <self> I:CXGroup F:CXGroup 4");
+}
+
 TEST_F(LiveChange, ThatDeletesManyRecordsIsWhatTheSingleSearchesGive) {
     Array members;
     Notification notification = changed({}, {}, {});
