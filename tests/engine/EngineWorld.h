@@ -178,7 +178,7 @@ private:
 class World {
 public:
     // `at`: a directory that outlives the world, for what is started again.
-    explicit World(bool publishes = true, std::string at = {}) : root(at.empty() ? directory.path() : std::move(at)) {
+    explicit World(bool publishes = true, std::string at = {}) : root(at.empty() ? directory.emplace().path() : std::move(at)) {
         CXRolvane::Options options;
         options.path = root + "/contacts.db";
         options.program = "RolvaneManager";
@@ -251,7 +251,7 @@ public:
     // Turns the loop until what is scheduled for now has run.
     void turn() { loop.runOnce(0); }
 
-    TempDirectory directory;
+    std::optional<TempDirectory> directory; // none: a killed process could not remove it
     const std::string root;
     ManualClock clock{Date(1000000)};
     NotificationCenter center, applicationCenter;
