@@ -6,6 +6,7 @@
 #include <arpa/inet.h>
 #include <cstring>
 #include <new>
+#include <sys/socket.h>
 
 namespace rolvane {
 
@@ -55,6 +56,7 @@ CurlSlot::CurlSlot(const CurlTransportOptions& options) : _easy(curl_easy_init()
     curl_easy_setopt(_easy, CURLOPT_HEADERDATA, this);
     curl_easy_setopt(_easy, CURLOPT_WRITEFUNCTION, &CurlSlot::onBody);
     curl_easy_setopt(_easy, CURLOPT_WRITEDATA, this);
+    curl_easy_setopt(_easy, CURLOPT_OPENSOCKETFUNCTION, &CurlSlot::onOpen);
     curl_easy_setopt(_easy, CURLOPT_PREREQFUNCTION, &CurlSlot::onConnected);
     curl_easy_setopt(_easy, CURLOPT_PREREQDATA, this);
     curl_easy_setopt(_easy, CURLOPT_NOSIGNAL, 1L);
@@ -176,6 +178,21 @@ bool CurlSlot::isIdle(SteadyTime now) {
         _lastMove = now;
     }
     return std::chrono::duration<double>(now - _lastMove).count() > _job->request.limits.idleSeconds;
+}
+
+bool CurlSlot::isStill(SteadyTime now, double seconds) const {
+    return std::chrono::duration<double>(now - _lastMove).count() > seconds;
+}
+
+bool CurlSlot::isHttp2() const {
+    long version = 0;
+    curl_easy_getinfo(_easy, CURLINFO_HTTP_VERSION, &version);
+    return version == CURL_HTTP_VERSION_2_0;
+}
+
+// A program that is started while the connection stands, such as a daemon, must not hold it.
+curl_socket_t CurlSlot::onOpen(void*, curlsocktype, curl_sockaddr* address) {
+    return ::socket(address->family, address->socktype | SOCK_CLOEXEC, address->protocol);
 }
 
 // Plain http leaves only towards this machine, whatever the name in the URL resolved to.

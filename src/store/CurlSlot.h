@@ -50,10 +50,14 @@ public:
 
     // True when not a byte has moved for the job's idle limit.
     bool isIdle(SteadyTime now);
+    // The same of so many seconds, as isIdle has seen it last.
+    bool isStill(SteadyTime now, double seconds) const;
+    bool isHttp2() const; // known when the connection is
 
 private:
     static size_t onHeader(char* data, size_t size, size_t count, void* self);
     static size_t onBody(char* data, size_t size, size_t count, void* self);
+    static curl_socket_t onOpen(void* self, curlsocktype purpose, curl_sockaddr* address);
     static int onConnected(void* self, char* peerAddress, char* localAddress, int peerPort, int localPort);
 
     bool takeHeaderLine(std::string_view line);

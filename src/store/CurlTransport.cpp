@@ -22,6 +22,9 @@ namespace {
 using namespace std::chrono;
 using Steady = steady_clock;
 
+constexpr double kStillSeconds = 0.2; // without a byte, of an answer that has begun
+constexpr double kNudgeDeadline = 10;
+
 steady_clock::duration inSeconds(double s) {
     return duration_cast<steady_clock::duration>(duration<double>(s));
 }
@@ -104,6 +107,7 @@ struct CurlTransport::Impl {
     void finished(CurlSlot& slot, CURLcode code);
     bool sendAgain(std::unique_ptr<HttpJob>& job);
     void checkDeadlines();
+    void nudge(SteadyTime now);
     void end(CurlSlot& slot, TransportError error, std::string detail);
     static void fail(std::unique_ptr<HttpJob> job, TransportError error, std::string detail);
     void detach(CurlSlot& slot);
@@ -133,6 +137,8 @@ struct CurlTransport::Impl {
     SteadyTime notBefore{}; // Retry-After
     std::optional<SteadyTime> curlTimer;
     SteadyTime nextCheck{};
+    SteadyTime nextNudge{};
+    double secondsToNudge = kStillSeconds;
     uint64_t seenEpoch = 0;
     std::thread thread;
 };
@@ -425,6 +431,7 @@ void CurlTransport::Impl::checkDeadlines() {
         else if (slot->isIdle(now))
             late.emplace_back(slot, "Not a byte moved for " + std::to_string(limits.idleSeconds) + " s.");
     }
+    nudge(now);
     for (auto& [slot, detail] : late) end(*slot, TransportError::timedOut, detail);
     // Whoever cannot be served before the deadline hears it now.
     std::deque<std::unique_ptr<HttpJob>> kept;
@@ -435,6 +442,34 @@ void CurlTransport::Impl::checkDeadlines() {
             kept.push_back(std::move(job));
     }
     pending = std::move(kept);
+}
+
+// httpd may forget the end of a stream, although it has sent the whole body, until something else moves on the
+// connection; the stream would stand still up to its limit. So while an answer that has begun over HTTP/2 stands still,
+// and nothing else moves, a small request goes out, at growing intervals.
+void CurlTransport::Impl::nudge(SteadyTime now) {
+    const HttpJob* still = nullptr;
+    for (const CurlSlot* slot : active) {
+        if (!slot->isHttp2()) continue;
+        if (!slot->isStill(now, kStillSeconds)) return;
+        if (slot->job()->headerDone) still = slot->job();
+    }
+    if (!still) {
+        secondsToNudge = kStillSeconds;
+        return;
+    }
+    if (now < nextNudge) return;
+    secondsToNudge *= 2;
+    nextNudge = now + inSeconds(secondsToNudge);
+    auto job = std::make_unique<HttpJob>();
+    job->request.method = "OPTIONS";
+    job->request.url = still->request.url;
+    job->origin = still->origin;
+    job->credentials = still->credentials;
+    job->deadline = now + inSeconds(kNudgeDeadline);
+    job->epoch = abortEpoch;
+    job->done = [](const HttpResponse&) {};
+    pending.push_front(std::move(job));
 }
 
 void CurlTransport::Impl::end(CurlSlot& slot, TransportError error, std::string detail) {
