@@ -146,6 +146,23 @@ TEST_F(Pass, ARemovalThatWaitedOfWhatIsInTheDatabaseAgainIsGivenUp) {
                                                    "Theirs:CXPerson 260", "Back:CXGroup 4", "AllCXGroup 261"}));
 }
 
+TEST(SingleGroups, ThatAreWithdrawnLeaveTheStoreThoughTheyStayInTheDatabase) {
+    World world(false);
+    CXMutableMultiValue nothing, locations;
+    locations.addValue("http://store.example/ann/Contacts", kCXPublishLabel);
+    world.rolvane->allGroup()->setValue(nothing, kCXRemoteLocationProperty);
+    for (const char* uid : {"Published:CXGroup", "Withdrawn:CXGroup"})
+        world.rolvane->addRecord(CXGroup::initWithUniqueId(UniqueId(uid)));
+    world.rolvane->recordForUniqueId(UniqueId("Published:CXGroup"))->setValue(locations, kCXRemoteLocationProperty);
+    world.subscribe("published-groups");
+    world.start();
+    world.engine->setPendingChanges({makeRecord(CXDDeleteGroup, nullptr, "Published:CXGroup"),
+                                     makeRecord(CXDDeleteGroup, nullptr, "Withdrawn:CXGroup")});
+    world.vaultra->whenApplying = [](const CXDChangeRecordPtr&, bool*) { return true; };
+    world.engine->applyChangeRecords({});
+    EXPECT_EQ(world.vaultra->applied(), Strings{"Withdrawn:CXGroup"});
+}
+
 TEST_F(Pass, WhoWaitedToBeListedAndIsGoneFromTheDatabaseIsTakenOutAndRemoved) {
     const CXPersonRef kept = CXPerson::initWithUniqueId(UniqueId("Kept:CXPerson"));
     world.rolvane->addRecord(kept);
