@@ -20,6 +20,7 @@ namespace rolvane {
 namespace {
 
 constexpr int kOk = 200;
+constexpr int kMissing = 404;
 constexpr int kForbidden = 403;
 // In the prior state of the owner's tree: something was amiss there that may be so for a moment only.
 constexpr const char* kLookAgain = "LookAgain";
@@ -342,6 +343,7 @@ bool CXDVaultraConduit::makeCompositeGroupChange(CXDChangeRecord& record, int& c
     if (!base || !record.group()) return false;
     const Url location = layout::groupLocation(*base, *record.group());
     auto state = _world.manager.dictionaryAtURL(location, false, &code);
+    if (!state && code == kMissing && wasDeletedThere(record)) return true;
     if (!state && code == kOk) state = lastKnownState(record);
     const Dictionary changed = layout::groupStateAfterComposite(state.value_or(Dictionary()), contentOf(record));
     // A state that is there and could not be read is not replaced by a part of it: the client then sends no write, and
@@ -350,6 +352,18 @@ bool CXDVaultraConduit::makeCompositeGroupChange(CXDChangeRecord& record, int& c
     const bool done = _world.manager.write(stringForDictionary(changed), location, kSecureRecordWrites, &written);
     if (written != 0) code = written;
     return done;
+}
+
+// A group of another user's that is known and whose state is gone, asked twice: it has been deleted there, and a part
+// of it would bring back what nobody wants under no name. The change is given up, and told.
+bool CXDVaultraConduit::wasDeletedThere(CXDChangeRecord& record) {
+    if (record.changeMadeByDataOwner() || !record.user() || !record.group()) return false;
+    if (engine().knownGroupState(kConduitVaultra, *record.user(), *record.group()).empty()) return false;
+    int code = 0;
+    const Url location = layout::groupLocation(*baseLocationOf(record), *record.group());
+    if (_world.manager.dictionaryAtURL(location, false, &code) || code != kMissing) return false;
+    CXLog("The group has been deleted by its publisher, and is not changed any more: %@", record.description());
+    return true;
 }
 
 // In the place of a state file that has come to harm: what it held when it was seen last, as far as such a file says

@@ -119,6 +119,7 @@ private:
     bool updateRecord(CXDChangeRecord& record, int& code);
     bool createStructureForGroup(CXDChangeRecord& record, int& code);
     bool makeCompositeGroupChange(CXDChangeRecord& record, int& code);
+    bool wasDeletedThere(CXDChangeRecord& record);
     Dictionary lastKnownState(const CXDChangeRecord& record);
     bool changeGroupName(CXDChangeRecord& record, int& code);
     bool addRecordToGroup(CXDChangeRecord& record, int& code);

@@ -61,6 +61,27 @@ TEST_F(TwoWriters, AnEditThatWaitsAndAnotherOneThatArrivesMeanwhileEndWithOneVal
     for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
 }
 
+TEST_F(TwoWriters, AGroupThatItsPublisherDeletedIsNotMadeAgainByTheOthersChange) {
+    const CXGroupRef circle = alice.group("Circle", {people[0]});
+    const UniqueId uid = circle->uniqueId();
+    alice.pass();
+    bob.pass();
+    const auto copy = std::dynamic_pointer_cast<CXGroup>(
+        bob.application->recordForUniqueId(cxUIDWithTableName(uid, kCXSubscribedGroupTable)));
+    ASSERT_TRUE(copy);
+    alice.application->removeRecord(circle);
+    alice.application->save();
+    alice.pass();
+    copy->addMember(bob.copyOf(people[1]));
+    copy->setValue(Value("Bob's circle"), kCXGroupNameProperty);
+    bob.application->save();
+    for (Participant* each : {&bob, &alice, &bob, &alice}) each->pass();
+    EXPECT_FALSE(alice.application->recordForUniqueId(uid)) << log.text();
+    EXPECT_EQ(copies(), alice.view());
+    EXPECT_FALSE(std::filesystem::exists(world->file(cxNormalizedUID(uid).str())));
+    for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
+}
+
 TEST_F(TwoWriters, AfterFiveHundredEditsEachBothDatabasesAndTheStoreAreEqual) {
     constexpr int kEdits = 500;
     std::mt19937 random(20260611);
