@@ -178,7 +178,8 @@ private:
 class World {
 public:
     // `at`: a directory that outlives the world, for what is started again.
-    explicit World(bool publishes = true, std::string at = {}) : root(at.empty() ? directory.emplace().path() : std::move(at)) {
+    explicit World(bool publishes = true, std::string at = {})
+        : root(at.empty() ? directory.emplace().path() : std::move(at)) {
         CXRolvane::Options options;
         options.path = root + "/contacts.db";
         options.program = "RolvaneManager";
