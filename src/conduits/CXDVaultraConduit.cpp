@@ -20,8 +20,8 @@ namespace rolvane {
 namespace {
 
 constexpr int kOk = 200;
-constexpr int kMissing = 404;
 constexpr int kForbidden = 403;
+constexpr int kMissing = 404;
 // In the prior state of the owner's tree: something was amiss there that may be so for a moment only.
 constexpr const char* kLookAgain = "LookAgain";
 
@@ -355,7 +355,7 @@ bool CXDVaultraConduit::makeCompositeGroupChange(CXDChangeRecord& record, int& c
 }
 
 // A group of another user's that is known and whose state is gone, asked twice: it has been deleted there, and a part
-// of it would bring back what nobody wants under no name. The change is given up, and told.
+// of it would bring it back without its name and members. The change is given up.
 bool CXDVaultraConduit::wasDeletedThere(CXDChangeRecord& record) {
     if (record.changeMadeByDataOwner() || !record.user() || !record.group()) return false;
     if (engine().knownGroupState(kConduitVaultra, *record.user(), *record.group()).empty()) return false;
