@@ -6,6 +6,7 @@
 #include "engine/Arrivals.h"
 #include "engine/ChangeQueue.h"
 #include "engine/GoneThings.h"
+#include "engine/Holdings.h"
 #include "engine/Mingler.h"
 #include "engine/OutOfOrderWork.h"
 #include "engine/PublicationCache.h"
@@ -58,12 +59,6 @@ Dictionary unsettledOwnGroups(const CXDChangeRecords& records, size_t fresh) {
     const size_t freshOwn = own.size();
     append(own, ownWrites({queue, records.end()}));
     return unsettledGroups(own, freshOwn);
-}
-
-// While only single groups are published, the list of locations is there and empty.
-bool publishesEverything(CXRolvane& rolvane) {
-    const auto locations = rolvane.allGroup()->multiValueForProperty(kCXRemoteLocationProperty);
-    return locations && !locations->empty();
 }
 
 // Tells the file managers what the apply loop is going to read, and that it has ended.
@@ -370,7 +365,7 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
     _parts.state.setPendingChanges(_pendingChanges);
     _queueStored = true;
     _end.unsureGroups.merge(groupsOf(ownWrites(_pendingChanges)));
-    _end.everythingIsPublished = publishesEverything(rolvane);
+    _end.everythingIsPublished = isPublished(*rolvane.allGroup());
     const bool lookAgain = noteUnsettled() && _pendingChanges.empty();
     _pendingChanges.clear();
     CXDChangeRecords refused = _parts.denied.all();

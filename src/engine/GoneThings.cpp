@@ -68,17 +68,13 @@ void dropRemovalsOfWhatIsBack(CXDChangeRecords& records, size_t fresh, CXRolvane
     const auto found = [&](const UniqueId& uid, std::string_view table) {
         return rolvane.recordForUniqueId(cxUIDWithTableName(uid, table));
     };
-    const auto isPublished = [](const CXGroupRef& group) {
-        const auto locations = group->multiValueForProperty(kCXRemoteLocationProperty);
-        return locations && !locations->empty();
-    };
     const auto isBack = [&](const CXDChangeRecordPtr& record) {
         if (record->initialSource() != CXDSyncSourceCX || !record->changeMadeByDataOwner()) return false;
         if (record->type() == CXDDeleteRecord) return record->person() && found(*record->person(), kCXPersonTable);
         if (record->type() != CXDDeleteGroup || !record->group() || record->group()->str() == kCXAllGroupUID)
             return false;
         const auto group = std::dynamic_pointer_cast<CXGroup>(found(*record->group(), kCXGroupTable));
-        return group && (isPublished(rolvane.allGroup()) || isPublished(group)); // a withdrawn one stays here, too
+        return group && (isPublished(*rolvane.allGroup()) || isPublished(*group)); // a withdrawn one stays here, too
     };
     const auto queue = records.begin() + static_cast<std::ptrdiff_t>(fresh);
     records.erase(std::remove_if(queue, records.end(), isBack), records.end());

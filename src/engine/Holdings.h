@@ -9,6 +9,12 @@
 
 namespace rolvane {
 
+// The all-contacts group's list of locations is there and empty while only single groups are published.
+inline bool isPublished(const CXGroup& group) {
+    const auto locations = group.multiValueForProperty(kCXRemoteLocationProperty);
+    return locations && !locations->empty();
+}
+
 // What the database still holds, under the own table or that of the subscribed copies; each identifier is asked for
 // once.
 class Holdings {

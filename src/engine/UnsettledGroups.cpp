@@ -14,20 +14,18 @@ Dictionary unsettledGroups(const CXDChangeRecords& records, size_t fresh) {
     Dictionary unsettled;
     if (records.size() <= fresh) return unsettled; // nothing waited
     std::unordered_map<UniqueId, Met> met;
-    for (size_t i = fresh; i < records.size(); ++i) {
+    const auto note = [&](const std::optional<UniqueId>& identifier, bool waited, bool isGroup) {
+        if (!identifier) return;
+        const auto found = waited ? met.try_emplace(*identifier).first : met.find(*identifier);
+        if (found == met.end()) return;
+        ++found->second.times;
+        found->second.isGroup |= waited && isGroup;
+    };
+    for (size_t i = records.size(); i-- > 0;) { // from the end: of the new ones only what meets one that waited counts
         const CXDChangeRecord& record = *records[i];
         if (record.initialSource() != CXDSyncSourceCX) continue;
-        if (record.group()) met[*record.group()].isGroup = true;
-        if (record.person()) met[*record.person()];
-    }
-    if (met.empty()) return unsettled;
-    const auto count = [&](const CXDChangeRecord& record, const std::optional<UniqueId>& identifier) {
-        if (!identifier || record.initialSource() != CXDSyncSourceCX) return;
-        if (const auto found = met.find(*identifier); found != met.end()) ++found->second.times;
-    };
-    for (const CXDChangeRecordPtr& record : records) {
-        count(*record, record->group());
-        if (record->person() != record->group()) count(*record, record->person());
+        note(record.group(), i >= fresh, true);
+        if (record.person() != record.group()) note(record.person(), i >= fresh, false);
     }
     for (const auto& [identifier, of] : met)
         if (of.isGroup || of.times > 1)
