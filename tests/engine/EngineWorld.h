@@ -128,9 +128,15 @@ public:
     std::vector<std::string> applied() const {
         const std::lock_guard guard(_lock);
         std::vector<std::string> names;
-        for (const CXDChangeRecordPtr& r : _applied)
-            names.push_back(r->person() ? r->person()->str() : r->group() ? r->group()->str() : "");
+        for (const CXDChangeRecordPtr& r : _applied) names.push_back(nameOf(*r));
         return names;
+    }
+    // Each with its change type behind it, in no order.
+    std::multiset<std::string> appliedWithTypes() const {
+        const std::lock_guard guard(_lock);
+        std::multiset<std::string> all;
+        for (const CXDChangeRecordPtr& r : _applied) all.insert(nameOf(*r) + " " + std::to_string(r->type()));
+        return all;
     }
     size_t threads() const {
         const std::lock_guard guard(_lock);
@@ -142,6 +148,9 @@ public:
     }
 
 private:
+    static std::string nameOf(const CXDChangeRecord& record) {
+        return record.person() ? record.person()->str() : record.group() ? record.group()->str() : "";
+    }
     Events& _events;
     std::string _id;
     int32_t _source;
