@@ -1,5 +1,6 @@
 #include "Context.h"
 #include "Counted.h"
+#include "LeftOnStore.h"
 #include "PassWatch.h"
 #include "Publication.h"
 #include "Subscriptions.h"
@@ -99,6 +100,7 @@ Json status(Context& context) {
             {"daemon", pid ? Json(*pid) : Json()},
             {"store", storeStatus()},
             {"published", {{"everything", publication.everything()}, {"groups", groups}}},
+            {"leftOnStore", anythingLeftOnStore(preferences)},
             {"subscriptions", subscriptions},
             {"withdrawn", withdrawnJson()},
             {"refused", refusedJson(preferences)},
@@ -143,6 +145,8 @@ void showStatus(Context& context) {
                                                : "cannot be used: " + store["reason"].get<std::string>());
     }
     row("Published", publishedText(s["published"]));
+    if (s["leftOnStore"])
+        row("", "files of what was withdrawn are still on the store; the same `rolvane unpublish` again removes them");
     row("Subscribed", subscribedText(s["subscriptions"]));
     for (const Json& record : s["withdrawn"]) row("Withdrawn", withdrawnText(record));
     for (const Json& record : s["refused"]) row("Refused", refusedText(record));

@@ -1,16 +1,14 @@
 #include "Context.h"
+#include "LeftOnStore.h"
 #include "Lookup.h"
 #include "Passes.h"
 #include "Publication.h"
 
-#include "conduits/PublishedLayout.h"
-#include "contacts/Constants.h"
 #include "daemon/DaemonControl.h"
-#include "foundation/PropertyList.h"
 #include "store/CXDAVManager.h"
-#include "store/CXWebDAVLock.h"
 
 #include <fmt/format.h>
+#include <functional>
 
 namespace rolvane::cli {
 
@@ -22,6 +20,36 @@ struct PublishOptions {
     double timeout = kPassSeconds;
 };
 
+// Whatever comes of the action, the daemon runs again in the end when it ran before.
+void whileDaemonRests(const std::function<void()>& action) {
+    const DaemonControl daemon;
+    const bool ran = daemon.stop();
+    try {
+        action();
+    } catch (const CXException&) {
+        if (ran) daemon.start();
+        throw;
+    }
+    if (ran) daemon.start();
+}
+
+CommandError notRemoved(const LeftOnStore::Failure& failure, const std::string& message) {
+    return CommandError(failure.code == 0 ? kUnreachable : kFailed, message);
+}
+
+// Files that nothing else knows of are not to stay among what is published now.
+void removeWhatIsLeft(CXRolvane& database, const Url& base) {
+    LeftOnStore left(database, Preferences::shared(), base);
+    if (!left.anything()) return;
+    whileDaemonRests([&] {
+        if (const auto failure = left.remove())
+            throw notRemoved(*failure, fmt::format("Of an earlier withdrawal {} could not be removed from the store "
+                                                   "({}). Nothing was published; run the command again when the store "
+                                                   "can be reached.",
+                                                   failure->what, failure->answer()));
+    });
+}
+
 void publish(Context& context, const PublishOptions& options) {
     const Url base = ownBase();
     CXRolvane& database = context.database();
@@ -31,6 +59,7 @@ void publish(Context& context, const PublishOptions& options) {
     CXDAVError error;
     if (!CXDAVManager::canReachOstrelError(error) && error.code == kCXDAVErrorAuthentication)
         throw CommandError(kRefused, error.reason + " Nothing was published.");
+    removeWhatIsLeft(database, base);
 
     PassWatch watch(context, !context.quiet);
     const CXGroupRef group = options.group.empty() ? nullptr : findGroup(database, options.group);
@@ -57,89 +86,54 @@ void publish(Context& context, const PublishOptions& options) {
     if (context.exitCode == kOk) context.say("Everything is on the store.");
 }
 
-std::string answer(int code) {
-    return code == 0 ? "it did not answer" : fmt::format("it answered {}", code);
+// What is withdrawn, as the beginning of a sentence.
+std::string withdraw(Publication& publication, LeftOnStore& left, const CXGroupRef& group) {
+    if (!group) {
+        publication.withdrawEverything();
+        for (const CXGroupRef& single : publication.groups()) publication.withdrawGroup(single);
+        return "Nothing is published any more";
+    }
+    const bool wasLeft = left.isLeft(group->uniqueId());
+    if (!publication.withdrawGroup(group) && !wasLeft)
+        throw CommandError(kNotFound, fmt::format("The group \"{}\" is not published by itself.", group->name()));
+    return fmt::format("The group \"{}\" is no longer published", group->name());
 }
 
-// Takes a group's files off the store: its state and directory, its mention in the list of groups, and the people of
-// nobody else's interest.
-void removeGroupFromStore(const Url& base, const UniqueId& group, const std::vector<UniqueId>& people) {
-    CXDAVManager& store = CXDAVManager::defaultManager();
-    int code = 0;
-    const auto refused = [&](const std::string& what) {
-        throw CommandError(code == 0 ? kUnreachable : kFailed,
-                           fmt::format("{} could not be removed from the store ({}). Run the command again "
-                                       "when the store can be reached; nothing else was lost.",
-                                       what, answer(code)));
-    };
-    const Url all = layout::groupLocation(base, UniqueId("AllCXGroup"));
-    if (auto state = store.dictionaryAtURL(all, true, &code)) {
-        Dictionary changed = state->mutableCopy();
-        Array subgroups = changed["subgroupUIDState"].array().mutableCopy();
-        subgroups.removeAll(group.str());
-        changed.set("subgroupUIDState", subgroups);
-        if (!store.write(PropertyList::toXML(changed), all, true, &code))
-            refused("The group's entry in the list of groups");
-    } else if (code != 404) {
-        refused("The group's entry in the list of groups");
-    }
-    if (!store.removeFileAtURL(layout::groupLocation(base, group), &code)) refused("The group");
-    for (const UniqueId& person : people)
-        if (!store.removeFileAtURL(layout::contactLocation(base, person), &code)) refused("A contact of the group");
+void unpublishAtRest(Context& context, const PublishOptions& options, const CXGroupRef& group) {
+    CXRolvane& database = context.database();
+    Preferences& preferences = Preferences::shared();
+    Publication publication(database);
+    LeftOnStore left(database, preferences, ownBase());
+    const auto people = group ? publication.peopleOnlyIn(group) : std::vector<UniqueId>{};
+    const bool isNews = group && publication.publishes(group);
+    const std::string done = withdraw(publication, left, group);
+    const bool wholeListStays = group && publication.everything();
+    const bool nothingLeft = !publication.anything();
+    const bool removes = !options.keep && !wholeListStays;
+    if (removes && nothingLeft)
+        left.noteTree();
+    else if (removes && isNews)
+        left.noteGroup(group->uniqueId(), people);
+    database.save();
+    if (nothingLeft)
+        forgetPublication(preferences);
+    else if (!wholeListStays)
+        forgetPublishedGroup(preferences, group->uniqueId());
+    if (options.keep) nothingLeft ? left.forgetTree() : left.forgetGroup(group->uniqueId());
+
+    if (const auto failure = removes ? left.remove() : std::nullopt)
+        throw notRemoved(*failure, fmt::format("{}, but {} could not be removed from the store ({}). Run the command "
+                                               "again when the store can be reached; nothing else was lost.",
+                                               done, failure->what, failure->answer()));
+    context.say(done + (wholeListStays ? " by itself; it stays on the store as part of the contact list."
+                        : removes      ? ", and its files are off the store."
+                                       : "."));
 }
 
 void unpublish(Context& context, const PublishOptions& options) {
-    const Url base = ownBase();
-    CXRolvane& database = context.database();
-    Publication publication(database);
-    const CXGroupRef group = options.group.empty() ? nullptr : findGroup(database, options.group);
-    const DaemonControl daemon;
-    const bool ran = daemon.stop(); // so that nothing is written behind our back
-    const auto people = group ? publication.peopleOnlyIn(group) : std::vector<UniqueId>{};
-
-    std::string done;
-    if (group) {
-        if (!publication.withdrawGroup(group))
-            throw CommandError(kNotFound, fmt::format("The group \"{}\" is not published by itself.", group->name()));
-        done = fmt::format("The group \"{}\" is no longer published", group->name());
-    } else {
-        publication.withdrawEverything();
-        for (const CXGroupRef& single : publication.groups()) publication.withdrawGroup(single);
-        done = "Nothing is published any more";
-    }
-    const bool wholeListStays = group && publication.everything();
-    const bool nothingLeft = !publication.anything();
-    database.save();
-    if (nothingLeft)
-        forgetPublication(Preferences::shared());
-    else if (group && !wholeListStays)
-        forgetPublishedGroup(Preferences::shared(), group->uniqueId());
-
-    bool removed = false;
-    try {
-        if (!options.keep && !wholeListStays) {
-            releaseLocksOfEndedRuns(CXDAVManager::defaultManager()); // they keep files on the store
-            if (nothingLeft) {
-                int code = 0;
-                removed = CXDAVManager::defaultManager().removeFileAtURL(base, &code);
-                if (!removed)
-                    throw CommandError(code == 0 ? kUnreachable : kFailed,
-                                       fmt::format("{}, but the files at {} could not be removed ({}). Run "
-                                                   "`rolvane unpublish` again when the store can be reached.",
-                                                   done, base.absoluteString(), answer(code)));
-            } else {
-                removeGroupFromStore(base, cxNormalizedUID(group->uniqueId()), people);
-                removed = true;
-            }
-        }
-    } catch (const CommandError&) {
-        if (ran) daemon.start();
-        throw;
-    }
-    if (ran) daemon.start();
-    context.say(done + (wholeListStays ? " by itself; it stays on the store as part of the contact list."
-                        : removed      ? ", and its files are off the store."
-                                       : "."));
+    ownBase(); // there is an account
+    const CXGroupRef group = options.group.empty() ? nullptr : findGroup(context.database(), options.group);
+    whileDaemonRests([&] { unpublishAtRest(context, options, group); }); // nothing is written behind our back
 }
 
 } // namespace

@@ -1,0 +1,136 @@
+#include "CommandWorld.h"
+
+#include <filesystem>
+#include <fstream>
+
+namespace rolvane::test {
+namespace {
+
+using Names = std::set<std::string>;
+
+// The store answers 500 to the removal of what the test names, and does as it is told otherwise.
+class Withdrawing : public testing::Test {
+protected:
+    Withdrawing() {
+        world.storeConfiguration = {"LoadModule rewrite_module /usr/lib/apache2/modules/mod_rewrite.so",
+                                    "RewriteEngine on"};
+        const std::map<std::string, std::string> rules{{"tree", "/Contacts/?$"}, {"people", "/Contacts/People/"}};
+        for (const auto& [name, path] : rules)
+            world.storeConfiguration.insert(world.storeConfiguration.end(), {"RewriteCond %{REQUEST_METHOD} =DELETE",
+                                                                             "RewriteCond \"" + flag(name) + "\" -f",
+                                                                             "RewriteRule \"" + path + "\" - [R=500]"});
+        world.bus();
+        world.makeAccount();
+        for (const char* name : {"Ada", "Bob", "Cid"}) uids[name] = world.add(name);
+    }
+    std::string flag(const std::string& what) { return world.home / ("store/root/dav/no-removal-of-" + what); }
+    void storeFailsAt(const std::string& what) { ASSERT_TRUE(std::ofstream(flag(what))); }
+    void storeWorksAgain() {
+        for (const char* what : {"tree", "people"}) std::filesystem::remove(flag(what));
+    }
+    bool anythingLeft() { return world.json({"status"})["leftOnStore"].get<bool>(); }
+    void publishTwoGroups() {
+        world.group("Family", {"Ada", "Bob"});
+        world.group("Work", {"Bob", "Cid"});
+        world.done({"publish", "--group", "Family"});
+        world.done({"publish", "--group", "Work"});
+    }
+    const Names family{"AllCXGroup", "Family", "People/Ada", "People/Bob", "dateFile", "info"};
+    std::map<std::string, std::string> uids;
+    CommandWorld world;
+};
+
+TEST_F(Withdrawing, ThatFailsInTheMiddleIsFinishedByTheNextPublication) {
+    world.done({"publish"});
+    storeFailsAt("tree");
+    EXPECT_TRUE(
+        saysOnce(world.rolvane({"unpublish"}), kFailure, "could not be removed from the store (it answered 500)"));
+    EXPECT_TRUE(anythingLeft());
+    EXPECT_NE(world.done({"status"}).find("still on the store"), std::string::npos);
+    for (const std::string& path : world.tree()) // it had come some way
+        if (path.ends_with(uids["Bob"]) || path == "info") std::filesystem::remove(world.published(path));
+    world.done({"delete", "--yes", "Ada"});
+
+    EXPECT_TRUE(saysOnce(world.rolvane({"publish"}), kFailure, "Nothing was published"));
+    EXPECT_EQ(world.json({"status"})["published"]["everything"], false);
+    storeWorksAgain();
+    world.done({"publish"});
+    EXPECT_EQ(world.namedTree(), (Names{"AllCXGroup", "People/Bob", "People/Cid", "dateFile", "info"}));
+    EXPECT_FALSE(anythingLeft());
+    EXPECT_EQ(world.json({"list"}).size(), 2U) << "the contacts stay";
+}
+
+TEST_F(Withdrawing, ThatFailsIsFinishedWhenItIsRepeated) {
+    world.done({"publish"});
+    storeFailsAt("tree");
+    EXPECT_EQ(world.rolvane({"unpublish"}).status, kFailure);
+    world.store().stop(PrivateStore::Stop::atOnce);
+    EXPECT_TRUE(saysOnce(world.rolvane({"unpublish"}), kNotReached, "it did not answer"));
+    world.store().start();
+    storeWorksAgain();
+    world.done({"unpublish"});
+    EXPECT_EQ(world.tree(), Names{});
+    EXPECT_FALSE(anythingLeft());
+}
+
+TEST_F(Withdrawing, OfAGroupThatFailsInTheMiddleIsFinishedWhenItIsRepeated) {
+    publishTwoGroups();
+    storeFailsAt("people");
+    EXPECT_TRUE(saysOnce(world.rolvane({"unpublish", "--group", "Work"}), kFailure, "a contact of the group"));
+    EXPECT_TRUE(world.namedTree().contains("People/Cid"));
+    EXPECT_TRUE(world.daemon()) << "it serves what is still published";
+    storeWorksAgain();
+    world.done({"unpublish", "--group", "Work"});
+    EXPECT_EQ(world.namedTree(), family);
+    EXPECT_FALSE(anythingLeft());
+    EXPECT_TRUE(saysOnce(world.rolvane({"unpublish", "--group", "Work"}), kNoSuchThing, "not published by itself"));
+    EXPECT_TRUE(world.daemon());
+}
+
+TEST_F(Withdrawing, OfAGroupThatFailsInTheMiddleIsFinishedByTheNextPublication) {
+    publishTwoGroups();
+    storeFailsAt("people");
+    EXPECT_EQ(world.rolvane({"unpublish", "--group", "Work"}).status, kFailure);
+    storeWorksAgain();
+    world.done({"delete", "--yes", "Cid"});
+    world.done({"publish", "--group", "Work"});
+    EXPECT_EQ(world.namedTree(),
+              (Names{"AllCXGroup", "Family", "Work", "People/Ada", "People/Bob", "dateFile", "info"}));
+    EXPECT_FALSE(anythingLeft());
+}
+
+TEST_F(Withdrawing, LeavesWhoHasComeIntoAnotherPublishedGroupBeforeItWasFinished) {
+    publishTwoGroups();
+    storeFailsAt("people");
+    EXPECT_EQ(world.rolvane({"unpublish", "--group", "Work"}).status, kFailure);
+    storeWorksAgain();
+    world.done({"group", "add", "Family", "Cid"});
+    world.done({"sync"});
+    world.done({"unpublish", "--group", "Work"});
+    Names withCid = family;
+    withCid.insert("People/Cid");
+    EXPECT_EQ(world.namedTree(), withCid);
+}
+
+TEST_F(Withdrawing, OfTheLastGroupThatFailsIsFinishedByTheSameCommand) {
+    world.group("Family", {"Ada", "Bob"});
+    world.done({"publish", "--group", "Family"});
+    storeFailsAt("tree");
+    EXPECT_EQ(world.rolvane({"unpublish", "--group", "Family"}).status, kFailure);
+    storeWorksAgain();
+    world.done({"unpublish", "--group", "Family"});
+    EXPECT_EQ(world.tree(), Names{});
+}
+
+TEST_F(Withdrawing, ThatFailedAndIsRepeatedWithKeepLeavesTheFiles) {
+    world.done({"publish"});
+    storeFailsAt("tree");
+    EXPECT_EQ(world.rolvane({"unpublish"}).status, kFailure);
+    storeWorksAgain();
+    world.done({"unpublish", "--keep"});
+    EXPECT_TRUE(world.namedTree().contains("People/Ada"));
+    EXPECT_FALSE(anythingLeft());
+}
+
+} // namespace
+} // namespace rolvane::test
