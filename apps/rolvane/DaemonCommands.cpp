@@ -64,23 +64,42 @@ Json refusedJson(const Preferences& preferences) {
     const Array notes = preferences.get(kDaemonDomain, kCXDRefusedChanges).array();
     for (const Value& value : notes) {
         const Dictionary note = value.dictionary();
+        const std::string& why = note[kRefusedWhy].string();
         all.push_back({{"user", note[kRefusedUser].string()},
+                       {"why", why.empty() ? "right" : why},
+                       {"group", note.contains(kRefusedGroup) ? Json(note[kRefusedGroup].string()) : Json()},
                        {"changes", note[kRefusedChanges].integer()},
                        {"date", dateOrNull(note[kRefusedDate])}});
     }
     return all;
 }
 
+std::string refusalReason(const Json& record) {
+    const std::string user = record["user"];
+    if (record["why"] == kRefusedAsGroupIsGone) {
+        const std::string group = record["group"].is_null()
+                                      ? "the group"
+                                      : fmt::format("the group \"{}\"", record["group"].get<std::string>());
+        return fmt::format("{} has deleted {} meanwhile, so what you changed in it was given up. Make another group "
+                           "to keep its people together.",
+                           user, group);
+    }
+    if (record["why"] == kRefusedForItsName)
+        return "the store keeps files of its own under that identifier. The change stays in this database.";
+    const std::string advice =
+        user == kSelf.str()
+            ? "Have the store's administrator let you write in your tree, then edit again."
+            : fmt::format("Ask {} for `rolvane share {} --write`, then edit again.", user, CXDAVManager::vaultraUser());
+    return "the store does not let you write there. " + advice;
+}
+
 std::string refusedText(const Json& record) {
     const int64_t changes = record["changes"];
     const std::string user = record["user"];
-    const bool own = user == kSelf.str();
-    const std::string advice =
-        own ? "Have the store's administrator let you write in your tree, then edit again."
-            : fmt::format("Ask {} for `rolvane share {} --write`, then edit again.", user, CXDAVManager::vaultraUser());
-    return fmt::format("{} of {} contacts, on {}: the store does not let you write there. {}",
-                       counted(changes, "change", "changes"), own ? "your own" : user + "'s",
-                       record["date"].is_null() ? "an unknown date" : record["date"].get<std::string>(), advice);
+    return fmt::format("{} of {} contacts, on {}: {}", counted(changes, "change", "changes"),
+                       user == kSelf.str() ? "your own" : user + "'s",
+                       record["date"].is_null() ? "an unknown date" : record["date"].get<std::string>(),
+                       refusalReason(record));
 }
 
 Json status(Context& context) {
@@ -239,8 +258,8 @@ void addDaemonCommands(CLI::App& app, Context& context) {
     });
     addCommand(*daemon, context, "status", "Tell whether it runs (exit code 0 or 3)", nullptr,
                [&context] { daemonStatus(context); });
-    addCommand(app, context, "status", "Tell what is shared, what waits, and what stores withdrew or refused", nullptr,
-               [&context] { showStatus(context); });
+    addCommand(app, context, "status", "Tell what is shared, what waits, and what was withdrawn, refused or given up",
+               nullptr, [&context] { showStatus(context); });
     const auto options = std::make_shared<WatchOptions>();
     addCommand(
         app, context, "watch", "Show the daemon's progress as it comes",

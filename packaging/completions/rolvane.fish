@@ -54,7 +54,7 @@ complete -c rolvane -n '__rolvane_at' -a subscriptions -d 'List the subscription
 complete -c rolvane -n '__rolvane_at' -a withdrawn -d 'Contacts that their publisher no longer shares: list, take back'
 complete -c rolvane -n '__rolvane_at' -a sync -d 'Make a pass now and wait for its end'
 complete -c rolvane -n '__rolvane_at' -a daemon -d 'Start, stop and find the daemon'
-complete -c rolvane -n '__rolvane_at' -a status -d 'Tell what is shared, what waits, and what stores withdrew or refused'
+complete -c rolvane -n '__rolvane_at' -a status -d 'Tell what is shared, what waits, and what was withdrawn, refused or given up'
 complete -c rolvane -n '__rolvane_at' -a watch -d 'Show the daemon\'s progress as it comes'
 complete -c rolvane -n '__rolvane_at' -a defaults -d 'Read and change preferences'
 complete -c rolvane -n '__rolvane_at' -a store -d 'A private store on this machine'

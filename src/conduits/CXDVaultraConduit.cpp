@@ -300,7 +300,7 @@ bool CXDVaultraConduit::mayBeNamed(const CXDChangeRecordPtr& record) {
         CXLog("\"%@\" is a name of the published tree's own, and no contact or group can be kept under it. The change "
               "stays in this database: %@",
               *name, record->description());
-        engine().noteRefused(record);
+        engine().noteRefused({record->user().value_or(UserName()), kRefusedForItsName});
         return false;
     }
     return true;
@@ -358,11 +358,13 @@ bool CXDVaultraConduit::makeCompositeGroupChange(CXDChangeRecord& record, int& c
 // of it would bring it back without its name and members. The change is given up.
 bool CXDVaultraConduit::wasDeletedThere(CXDChangeRecord& record) {
     if (record.changeMadeByDataOwner() || !record.user() || !record.group()) return false;
-    if (engine().knownGroupState(kConduitVaultra, *record.user(), *record.group()).empty()) return false;
+    const Dictionary known = engine().knownGroupState(kConduitVaultra, *record.user(), *record.group());
+    if (known.empty()) return false;
     int code = 0;
     const Url location = layout::groupLocation(*baseLocationOf(record), *record.group());
     if (_world.manager.dictionaryAtURL(location, false, &code) || code != kMissing) return false;
     CXLog("The group has been deleted by its publisher, and is not changed any more: %@", record.description());
+    engine().noteRefused({*record.user(), kRefusedAsGroupIsGone, known[kCXGroupNameProperty].string()});
     return true;
 }
 

@@ -3,6 +3,7 @@
 #include "acl/CXACLManager.h"
 #include "foundation/Value.h"
 #include "model/CXDChangeRecord.h"
+#include "model/Refusal.h"
 
 #include <optional>
 #include <string>
@@ -30,8 +31,8 @@ public:
     virtual std::optional<RemoteLocation> remoteLocationForSubscriptionUID(const UniqueId& subscription) const = 0;
 
     virtual bool shouldChangeRecordBeCanceled(const CXDChangeRecord& record) const = 0; // any thread
-    // The record came to an end without being carried out, and the person is to be told. Any thread.
-    virtual void noteRefused(const CXDChangeRecordPtr& /*record*/) {}
+    // The person is to be told. Any thread.
+    virtual void noteRefused(const Refusal& /*refusal*/) {}
     virtual bool lockURL(const Url& url) = 0; // any thread
     virtual int32_t sourcesForGUID(const UniqueId& group) = 0;
     virtual CXDConduit* conduitForSyncSource(int32_t source) = 0; // none when no conduit serves it

@@ -368,8 +368,9 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
     _end.everythingIsPublished = isPublished(*rolvane.allGroup());
     const bool lookAgain = noteUnsettled() && _pendingChanges.empty();
     _pendingChanges.clear();
-    CXDChangeRecords refused = _parts.denied.all();
-    append(refused, _parts.state.takeRefused());
+    std::vector<Refusal> refused = _parts.state.takeRefused();
+    for (const CXDChangeRecordPtr& record : _parts.denied.all())
+        refused.push_back({record->user().value_or(UserName())});
     if (!refused.empty()) _parts.state.noteRefusedChanges(refused, _parts.with.clock.now());
     if (!_parts.denied.empty() || lookAgain) {
         _parts.denied.clear();

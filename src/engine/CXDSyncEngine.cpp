@@ -318,8 +318,8 @@ CXDConduit* CXDSyncEngine::conduitForSyncSource(int32_t source) {
 
 // -- conflicts, cache, locks, revocation
 
-void CXDSyncEngine::noteRefused(const CXDChangeRecordPtr& record) {
-    _parts->state.noteRefused(record);
+void CXDSyncEngine::noteRefused(const Refusal& refusal) {
+    _parts->state.noteRefused(refusal);
 }
 bool CXDSyncEngine::shouldChangeRecordBeCanceled(const CXDChangeRecord& record) const {
     return _parts->denied.contains(record);

@@ -78,7 +78,7 @@ public:
     CXDConduit* conduitForSyncSource(int32_t source) override;
 
     // Conflicts, cache, locks, revocation.
-    void noteRefused(const CXDChangeRecordPtr& record) override;
+    void noteRefused(const Refusal& refusal) override;
     bool shouldChangeRecordBeCanceled(const CXDChangeRecord& record) const override;
     void cancelPendingChangesLike(const CXDChangeRecordPtr& denied, const CXDChangeRecords& amongst);
     Dictionary payloadMerging(const Dictionary& first, const Dictionary& into);

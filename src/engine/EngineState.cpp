@@ -8,6 +8,7 @@
 
 #include <algorithm>
 #include <map>
+#include <tuple>
 #include <utility>
 
 namespace rolvane {
@@ -133,23 +134,28 @@ void EngineState::setUnderWay(const Dictionary& underWay) {
     _preferences.set(kDaemonDomain, kCXDUnderWay, underWay.empty() ? Value() : Value(underWay));
 }
 
-void EngineState::noteRefusedChanges(const CXDChangeRecords& records, Date when) {
+void EngineState::noteRefusedChanges(const std::vector<Refusal>& refusals, Date when) {
     constexpr size_t kKept = 20;
-    std::map<std::string, int64_t> byUser;
-    for (const CXDChangeRecordPtr& record : records) ++byUser[record->user().value_or(UserName()).str()];
+    std::map<std::tuple<std::string, std::string, std::string>, int64_t> alike;
+    for (const Refusal& refusal : refusals) ++alike[{refusal.user.str(), refusal.why, refusal.group}];
     Array notes = _preferences.get(kDaemonDomain, kCXDRefusedChanges).array().mutableCopy();
-    for (const auto& [user, changes] : byUser)
-        notes.append(Dictionary{{kRefusedDate, when}, {kRefusedUser, user}, {kRefusedChanges, changes}});
+    for (const auto& [of, changes] : alike) {
+        const auto& [user, why, group] = of;
+        Dictionary note{{kRefusedDate, when}, {kRefusedUser, user}, {kRefusedChanges, changes}};
+        if (!why.empty()) note.set(kRefusedWhy, why);
+        if (!group.empty()) note.set(kRefusedGroup, group);
+        notes.append(note);
+    }
     while (notes.count() > kKept) notes.removeAt(0);
     _preferences.set(kDaemonDomain, kCXDRefusedChanges, notes);
 }
 
-void EngineState::noteRefused(const CXDChangeRecordPtr& record) {
+void EngineState::noteRefused(const Refusal& refusal) {
     const std::lock_guard guard(_lock);
-    _refused.push_back(record);
+    _refused.push_back(refusal);
 }
 
-CXDChangeRecords EngineState::takeRefused() {
+std::vector<Refusal> EngineState::takeRefused() {
     const std::lock_guard guard(_lock);
     return std::exchange(_refused, {});
 }

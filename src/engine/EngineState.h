@@ -4,11 +4,13 @@
 #include "foundation/StrongString.h"
 #include "foundation/Value.h"
 #include "model/CXDChangeRecord.h"
+#include "model/Refusal.h"
 
 #include <functional>
 #include <mutex>
 #include <optional>
 #include <string>
+#include <vector>
 
 namespace rolvane {
 
@@ -29,6 +31,8 @@ inline constexpr const char* kCXDRefusedChanges = "CXDRefusedChanges";
 inline constexpr const char* kRefusedDate = "date";
 inline constexpr const char* kRefusedUser = "user";       // whose contacts they were
 inline constexpr const char* kRefusedChanges = "changes"; // how many
+inline constexpr const char* kRefusedWhy = "why";         // as Refusal has them; missing when empty
+inline constexpr const char* kRefusedGroup = "group";
 
 // The engine's memory: the conduit data and the queue, in the daemon's preferences. The conduit data is read on first
 // need and lives in memory until it is dropped. Finding a conduit's dictionary is safe on any thread; the dictionaries
@@ -65,10 +69,10 @@ public:
     void setUnderWay(const Dictionary& underWay); // without synchronising; empty: removes it
 
     // Adds what a pass was refused; the oldest are forgotten. Without synchronising.
-    void noteRefusedChanges(const CXDChangeRecords& records, Date when);
+    void noteRefusedChanges(const std::vector<Refusal>& refusals, Date when);
     // What a pass meets on its way, for that note. Any thread; in memory only.
-    void noteRefused(const CXDChangeRecordPtr& record);
-    CXDChangeRecords takeRefused();
+    void noteRefused(const Refusal& refusal);
+    std::vector<Refusal> takeRefused();
 
     // Subscription identifier to remote location. Nothing happens when one of the two is missing.
     void setRemoteLocationForSubscriptionUID(const std::optional<RemoteLocation>& location,
@@ -93,7 +97,7 @@ private:
     Preferences& _preferences;
     std::mutex _lock;
     std::optional<Dictionary> _conduitData; // guarded by _lock, as is
-    CXDChangeRecords _refused;
+    std::vector<Refusal> _refused;
 };
 
 } // namespace rolvane

@@ -275,6 +275,7 @@ TEST_F(Rights, AnEditThatCameTooLateIsRefusedToldAndLeavesTheQueue) {
     const nlohmann::json refused = bob.json({"status"})["refused"];
     ASSERT_EQ(refused.size(), 1U) << refused;
     EXPECT_EQ(refused[0]["user"], "alice");
+    EXPECT_EQ(refused[0]["why"], "right");
     EXPECT_GE(refused[0]["changes"], 1);
     const std::string told = bob.done({"status"});
     EXPECT_NE(told.find("does not let you write there. Ask alice for `rolvane share bob --write`"), std::string::npos)
@@ -284,6 +285,29 @@ TEST_F(Rights, AnEditThatCameTooLateIsRefusedToldAndLeavesTheQueue) {
     EXPECT_EQ(world.done({"show", "Ada"}).find("too late"), std::string::npos);
     bob.done({"sync"});
     EXPECT_EQ(bob.done({"show", "Ada"}).find("too late"), std::string::npos) << "the copy is the publisher's again";
+}
+
+TEST_F(Rights, AChangeOfAGroupThatItsPublisherDeletedIsGivenUpAndTold) {
+    world.group("Circle", {"Ada"});
+    world.done({"publish"});
+    world.done({"share", "bob", "--write"});
+    bob.done({"subscribe", "alice"});
+    bob.done({"daemon", "stop"});
+    bob.done({"group", "add", "Circle", "Bea"});
+    world.done({"group", "delete", "Circle"});
+    world.done({"sync"});
+    bob.done({"sync"});
+    const nlohmann::json status = bob.json({"status"});
+    EXPECT_EQ(status["pending"], 0);
+    ASSERT_EQ(status["refused"].size(), 1U) << status;
+    EXPECT_EQ(status["refused"][0]["user"], "alice");
+    EXPECT_EQ(status["refused"][0]["why"], "groupIsGone");
+    EXPECT_EQ(status["refused"][0]["group"], "Circle");
+    EXPECT_EQ(status["refused"][0]["changes"], 1);
+    const std::string told = bob.done({"status"});
+    EXPECT_NE(told.find("alice has deleted the group \"Circle\" meanwhile"), std::string::npos) << told;
+    world.done({"sync"});
+    EXPECT_EQ(world.rolvane({"group", "show", "Circle"}).status, kNoSuchThing) << "it is not made again";
 }
 
 // Name -> members, groups in it and choices, of the publisher's groups or of their copies.

@@ -54,7 +54,7 @@ public:
     bool shouldChangeRecordBeCanceled(const CXDChangeRecord& record) const override {
         return canceledUser && record.user() == canceledUser;
     }
-    void noteRefused(const CXDChangeRecordPtr& record) override { refused.push_back(record); }
+    void noteRefused(const Refusal& refusal) override { refused.push_back(refusal); }
     bool lockURL(const Url& url) override {
         note("lock " + url.absoluteString());
         return locks;
@@ -82,7 +82,7 @@ public:
     void cancel() override { note("cancel"); }
 
     mutable std::function<void()> whenAskedForAUser; // once
-    CXDChangeRecords refused;
+    std::vector<Refusal> refused;
 
     std::vector<std::string> takeCalls() {
         const std::lock_guard guard(_lock);

@@ -496,7 +496,9 @@ TEST_F(VaultraConduit, ARecordThatIsCalledLikeTheTreesOwnFilesTouchesNothingAndI
         denied = true;
         EXPECT_TRUE(conduit->applyChangeRecordIfNeeded(each, &denied)) << name << ": it would wait for ever";
         EXPECT_FALSE(denied) << name << ": the user's other changes are not to go with it";
-        EXPECT_EQ(engine.refused, CXDChangeRecords{each}) << name;
+        ASSERT_EQ(engine.refused.size(), 1u) << name;
+        EXPECT_EQ(engine.refused[0].user, each->user());
+        EXPECT_EQ(engine.refused[0].why, kRefusedForItsName);
         EXPECT_EQ(log.lines().size(), 1u) << log.text();
         EXPECT_NE(log.text().find("\"" + name + "\" is a name of the published tree's own"), std::string::npos);
     };

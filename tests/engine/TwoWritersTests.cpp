@@ -1,6 +1,7 @@
 // Two people who write to one tree at the same time.
 
 #include "TwoUsers.h"
+#include "engine/EngineState.h"
 
 namespace rolvane::test {
 
@@ -79,6 +80,12 @@ TEST_F(TwoWriters, AGroupThatItsPublisherDeletedIsNotMadeAgainByTheOthersChange)
     EXPECT_FALSE(alice.application->recordForUniqueId(uid)) << log.text();
     EXPECT_EQ(copies(), alice.view());
     EXPECT_FALSE(std::filesystem::exists(world->file(cxNormalizedUID(uid).str())));
+    const Array told = bob.preferences.get(kDaemonDomain, kCXDRefusedChanges).array();
+    ASSERT_EQ(told.count(), 1u) << log.text();
+    const Dictionary refused = told[0].dictionary();
+    EXPECT_EQ(refused[kRefusedUser], Value("alice"));
+    EXPECT_EQ(refused[kRefusedWhy], Value(kRefusedAsGroupIsGone));
+    EXPECT_EQ(refused[kRefusedGroup], Value("Circle"));
     for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
 }
 
