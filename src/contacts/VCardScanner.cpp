@@ -150,15 +150,6 @@ bool VCardScanner::readPhysical(std::string& into, size_t limit, bool& tooLong) 
     return true;
 }
 
-size_t VCardScanner::limitFor(const std::string& text) const {
-    std::string head = headOf(text);
-    size_t dot = head.find('.');
-    size_t nameStart = dot != std::string::npos && dot < head.find_first_of(";:") ? dot + 1 : 0;
-    std::string name = head.substr(nameStart, head.find_first_of(";:", nameStart) - nameStart);
-    bool big = name == "PHOTO" || name == "LOGO" || name == "SOUND" || name == "KEY";
-    return big ? _limits.photoLineBytes : _limits.lineBytes;
-}
-
 // Whether the physical line continues the logical one; what it adds is appended by the caller after this has taken a
 // soft line break off.
 bool VCardScanner::continues(Unfolded& line, const std::string& next) const {
@@ -172,7 +163,7 @@ bool VCardScanner::continues(Unfolded& line, const std::string& next) const {
 
 bool VCardScanner::readUnfolded(Unfolded& line) {
     line = {};
-    size_t most = std::max(_limits.lineBytes, _limits.photoLineBytes);
+    const size_t most = _limits.lineBytes;
     if (_haveAhead) {
         line.text.swap(_ahead);
         line.tooLong = _aheadTooLong;
@@ -196,8 +187,6 @@ bool VCardScanner::readUnfolded(Unfolded& line) {
         else
             line.text.append(_ahead, blank ? 1 : 0);
     }
-    size_t least = std::min(_limits.lineBytes, _limits.photoLineBytes);
-    if (line.text.size() > least && line.text.size() > limitFor(line.text)) line.tooLong = true;
     return true;
 }
 
@@ -278,7 +267,7 @@ std::optional<std::string> VCardScanner::nestedCard() {
 
 bool VCardScanner::addLine(VCard& card, Unfolded& line) {
     if (line.tooLong) {
-        reject(line.number, "the line is longer than " + sizeText(limitFor(line.text)));
+        reject(line.number, "the line is longer than " + sizeText(_limits.lineBytes));
         return false;
     }
     if (isBlank(line.text)) return true;

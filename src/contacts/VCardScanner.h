@@ -30,9 +30,8 @@ struct VCard {
 
 // What an input may cost. A card beyond a limit is a bad card, and its text is not held in memory.
 struct VCardLimits {
-    size_t lineBytes = 1 << 20;       // an unfolded content line
-    size_t photoLineBytes = 16 << 20; // the same for PHOTO, LOGO, SOUND and KEY
-    size_t cardBytes = 64 << 20;      // all lines of a card together, with kVCardLineCost bytes for each
+    size_t lineBytes = 16 << 20; // an unfolded content line, a photo's among them
+    size_t cardBytes = 64 << 20; // all lines of a card together, with kVCardLineCost bytes for each
 };
 
 inline constexpr size_t kVCardLineCost = 200;
@@ -69,7 +68,6 @@ private:
     bool readPhysical(std::string& into, size_t limit, bool& tooLong);
     bool readUnfolded(Unfolded& line);
     bool continues(Unfolded& line, const std::string& next) const;
-    size_t limitFor(const std::string& text) const;
 
     std::optional<VCard> readCard(size_t beginLine);
     bool addLine(VCard& card, Unfolded& line);
