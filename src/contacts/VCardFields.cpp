@@ -377,6 +377,8 @@ const char* vcardLineForTextProperty(std::string_view property) {
 }
 
 std::string vcardEncodeSingle(std::string_view lineName, const Dictionary& properties, bool isGroup) {
+    if (lineName == "KIND")
+        return isGroup ? "group" : properties[kCXIsCompanyProperty].boolean() ? "org" : "individual";
     if (lineName == "FN" && isGroup) return vcardEscape(textOf(properties, kCXGroupNameProperty));
     if (lineName == "FN") {
         std::string formatted = textOf(properties, kCXFormattedNameProperty);

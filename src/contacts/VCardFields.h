@@ -57,7 +57,7 @@ std::string vcardEncodeNickname(const Dictionary& person);
 const char* vcardTextPropertyForLine(std::string_view lineName);
 const char* vcardLineForTextProperty(std::string_view property);
 
-// The raw value of a line of which a card has one (FN, N, NICKNAME, ORG, BDAY, PHOTO and those of
+// The raw value of a line of which a card has one (KIND, FN, N, NICKNAME, ORG, BDAY, PHOTO and those of
 // vcardTextPropertyForLine, by the names that are written), "" when the properties have none. A BDAY is in the form of
 // vCard 4.0; for a PHOTO it is a digest of the bytes.
 std::string vcardEncodeSingle(std::string_view lineName, const Dictionary& properties, bool isGroup);

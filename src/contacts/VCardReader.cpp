@@ -72,6 +72,12 @@ private:
         Value value;
     };
 
+    struct ListCarrier {
+        const VCardLine* line;
+        const char* writtenName;
+        std::string value;
+    };
+
     std::nullopt_t bad(size_t line, std::string reason) {
         _error.line = line;
         _error.reason = std::move(reason);
@@ -96,9 +102,7 @@ private:
         if (_entity.isGroup && takeOfGroup(line)) return true;
         if (line.name == "PHOTO") return takePhoto(line);
         if (line.name == "CATEGORIES" && !_entity.isGroup) {
-            auto names = vcardDecodeList(line);
-            _entity.categories.insert(_entity.categories.end(), names.begin(), names.end());
-            return true;
+            return takeCategories(line);
         }
         if (!takeMulti(line) && !takeSingle(line)) keep(line);
         return true;
@@ -115,17 +119,32 @@ private:
 
     bool takeKind(const VCardLine& line) {
         std::string kind = vcardLower(vcardTrim(line.value));
-        if (kind == "org" || kind == "organization")
-            _entity.properties.set(kCXIsCompanyProperty, true);
-        else if (kind != "group" && kind != "individual")
-            keep(line);
+        const bool company = kind == "org" || kind == "organization";
+        if (company) _entity.properties.set(kCXIsCompanyProperty, true);
+        if (!company && kind != "group" && kind != "individual") return keep(line), true;
+        if (!saysMore(line)) return true;
+        if (!_seen.insert("KIND").second) return keep(line), true;
+        return carrySingle(line, "KIND");
+    }
+
+    bool takeCategories(const VCardLine& line) {
+        auto names = vcardDecodeList(line);
+        use(line.group);
+        if (saysMore(line) && !names.empty()) _listCarriers.push_back({&line, "CATEGORIES", vcardEncodeList(names)});
+        _entity.categories.insert(_entity.categories.end(), names.begin(), names.end());
+        return true;
+    }
+
+    bool takeMember(const VCardLine& line, std::vector<std::string>& members) {
+        members.emplace_back(vcardTrim(vcardUnescape(line.value)));
+        use(line.group);
+        if (saysMore(line)) _listCarriers.push_back({&line, "MEMBER", vcardEscape(members.back())});
         return true;
     }
 
     bool takeOfGroup(const VCardLine& line) {
-        if (line.name == "X-ROLVANE-SUBGROUP")
-            return _entity.subgroups.emplace_back(vcardTrim(vcardUnescape(line.value))), true;
-        if (isMemberLine(line)) return _entity.members.emplace_back(vcardTrim(vcardUnescape(line.value))), true;
+        if (line.name == "X-ROLVANE-SUBGROUP") return takeMember(line, _entity.subgroups);
+        if (isMemberLine(line)) return takeMember(line, _entity.members);
         if (line.name == "X-ROLVANE-CHOICE") {
             _entity.choices.push_back({line.firstValueOf("X-MEMBER"), line.firstValueOf("X-PROPERTY"),
                                        line.firstValueOf("X-LABEL"), line.value});
@@ -331,6 +350,20 @@ private:
         }
     }
 
+    // Lines whose values are written from a list.
+    void finishListCarriers() {
+        for (auto& [line, name, value] : _listCarriers) {
+            VCardLine carrier;
+            if (keptGroup(*line)) carrier.group = line->group;
+            carrier.name = name;
+            for (const auto& p : line->parameters)
+                if (!isSpent(p)) carrier.parameters.push_back(p);
+            if (carrier.group.empty() && carrier.parameters.empty()) continue;
+            carrier.value = std::move(value);
+            _extras.push_back("+" + vcardFormatLine(carrier));
+        }
+    }
+
     static bool addSurplus(const VCardLine& line, VCardLine& carrier) {
         std::string surplus = vcardSurplusParts(line);
         if (!surplus.empty()) carrier.add("X-ROLVANE-REST", surplus);
@@ -406,6 +439,7 @@ private:
 
     void storeExtras() {
         finishSingleCarriers();
+        finishListCarriers();
         finishMultiCarriers();
         if (_extras.empty()) return;
         std::sort(_extras.begin(), _extras.end());
@@ -431,6 +465,7 @@ private:
     std::set<std::string, std::less<>> _seen;
     std::vector<std::pair<std::string, const VCardLine*>> _exact;
     std::vector<std::pair<const VCardLine*, std::string>> _singleCarriers; // with the names that are written
+    std::vector<ListCarrier> _listCarriers;
     std::vector<MultiCarrier> _multiCarriers;
     std::vector<std::string> _extras;
 };

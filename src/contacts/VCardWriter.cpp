@@ -8,7 +8,9 @@
 #include "foundation/PropertyList.h"
 
 #include <algorithm>
+#include <map>
 #include <set>
+#include <unordered_map>
 #include <utility>
 
 namespace rolvane {
@@ -40,10 +42,11 @@ public:
 
     std::string text() {
         readExtras();
+        int times = 0;
         do {
             compose();
             readBack();
-        } while (wrapWhatMeansSomethingElse());
+        } while (wrapWhatMeansSomethingElse(++times >= kMostTimes));
         writeInexact();
         std::string out = "BEGIN:VCARD\r\nVERSION:";
         out += _v4 ? "4.0\r\n" : "3.0\r\n";
@@ -52,15 +55,21 @@ public:
     }
 
 private:
+    // One line that is out of the way may leave its meaning to the next: in the end all kept lines go out of the way.
+    static constexpr int kMostTimes = 3;
+
     struct Carrier {
         VCardLine line;
         std::string label;
-        bool used = false;
+    };
+    struct Alike { // carriers of one name, value and label; each serves one line
+        std::vector<const Carrier*> all;
+        size_t next = 0;
     };
 
     void compose() {
         _lines.clear();
-        for (auto& c : _carriers) c.used = false;
+        for (auto& [key, alike] : _alike) alike.next = 0;
         _labelled.clear();
         _groupCount = 0;
         _anniversary = false;
@@ -86,8 +95,8 @@ private:
     }
 
     // A kept line may stand beside a property that is no longer there, and would be taken for it. Such lines go inside
-    // an X-ROLVANE-KEPT, all of a name together. True when the text must be made anew.
-    bool wrapWhatMeansSomethingElse() {
+    // an X-ROLVANE-KEPT, all of a name together, or `all` that there are. True when the text must be made anew.
+    bool wrapWhatMeansSomethingElse(bool all) {
         if (_plain.empty()) return false;
         std::multiset<std::string> kept;
         bool readable = _back && _back->isGroup == _entity.isGroup;
@@ -101,7 +110,10 @@ private:
             else if (line.name != "UID" && line.name != "X-ROLVANE-KEPT")
                 _wrapped.insert(line.name);
         }
-        return _wrapped.size() > before;
+        if (_wrapped.size() == before) return false;
+        for (const auto& line : _plain)
+            if (all && line.name != "UID" && line.name != "X-ROLVANE-KEPT") _wrapped.insert(line.name);
+        return true;
     }
 
     void readExtras() {
@@ -124,13 +136,28 @@ private:
             }
             std::string label = line->firstValueOf("X-ROLVANE-LABEL");
             std::erase_if(line->parameters, [](const VCardParameter& p) { return p.name == "X-ROLVANE-LABEL"; });
-            _carriers.push_back({std::move(*line), std::move(label), false});
+            _carriers.push_back({std::move(*line), std::move(label)});
         }
         // Of equal entries the preferred one comes first.
         std::stable_sort(_carriers.begin(), _carriers.end(), [](const Carrier& a, const Carrier& b) {
             return preferenceOf(a.line) < preferenceOf(b.line);
         });
+        for (const auto& c : _carriers) {
+            if (c.line.name == "CATEGORIES")
+                for (const auto& name : vcardDecodeList(c.line)) _ofCategory.emplace(name, &c);
+            const bool member = c.line.name == "MEMBER";
+            _alike[keyOf(c.line.name, member ? memberKey(vcardUnescape(c.line.value)) : c.line.value, c.label)]
+                .all.push_back(&c);
+        }
     }
+
+    static std::string keyOf(std::string_view name, std::string_view value, std::string_view label) {
+        std::string key(name); // no line has a line feed in it
+        return key.append("\n").append(label).append("\n").append(value);
+    }
+
+    // Whoever the UID means, however it is spelt.
+    static std::string memberKey(std::string_view uid) { return vcardLower(vcardUUIDForUID(uid)); }
 
     static int preferenceOf(const VCardLine& line) {
         const VCardParameter* p = line.parameter("PREF");
@@ -156,8 +183,23 @@ private:
         VCardLine line;
         line.name = name;
         line.value = vcardEncodeSingle(name, _p, _entity.isGroup);
-        if (const Carrier* c = carrierFor(line, "")) take(*c, line);
+        if (const Carrier* c = carrierFor(line.name, line.value, "")) take(*c, line);
         return line;
+    }
+
+    void emitKind() {
+        VCardLine line = single("KIND");
+        const bool plain = line.group.empty() && line.parameters.empty();
+        line.name = _v4 ? "KIND" : "X-ROLVANE-KIND";
+        if (line.value != "individual" || !plain) emit(std::move(line));
+    }
+
+    void emitMember(const char* name, const std::string& uid) {
+        VCardLine line;
+        line.name = name;
+        line.value = vcardEscape(uid);
+        if (const Carrier* c = carrierFor("MEMBER", memberKey(uid), "")) take(*c, line);
+        emit(std::move(line));
     }
 
     static void take(const Carrier& carrier, VCardLine& line) {
@@ -169,13 +211,10 @@ private:
         std::erase_if(line.parameters, [](const VCardParameter& p) { return p.name == "X-ROLVANE-REST"; });
     }
 
-    Carrier* carrierFor(const VCardLine& line, const std::string& label) {
-        for (auto& c : _carriers) {
-            if (c.used || c.line.name != line.name || c.line.value != line.value || c.label != label) continue;
-            c.used = true;
-            return &c;
-        }
-        return nullptr;
+    const Carrier* carrierFor(std::string_view name, std::string_view value, std::string_view label) {
+        const auto found = _alike.find(keyOf(name, value, label));
+        if (found == _alike.end() || found->second.next == found->second.all.size()) return nullptr;
+        return found->second.all[found->second.next++];
     }
 
     std::string plain(std::string_view property) const {
@@ -192,16 +231,32 @@ private:
         if (const Array* own = _p[kCXCategoriesProperty].arrayIf())
             for (const auto& v : *own) names.push_back(v.string());
         names.insert(names.end(), _entity.categories.begin(), _entity.categories.end());
-        std::vector<std::string> once;
-        for (const auto& n : names)
-            if (!n.empty() && vcardIsPlainText(n) && std::find(once.begin(), once.end(), n) == once.end())
-                once.push_back(n);
-        if (!once.empty()) emit("CATEGORIES", vcardEncodeList(once));
+        // In their order, but those that stood in one line with parameters go together.
+        std::vector<std::pair<const Carrier*, std::vector<std::string>>> lines;
+        std::map<const Carrier*, size_t> placeOf;
+        std::set<std::string> seen;
+        for (const auto& n : names) {
+            if (n.empty() || !vcardIsPlainText(n) || !seen.insert(n).second) continue;
+            const auto carried = _ofCategory.find(n);
+            const Carrier* carrier = carried == _ofCategory.end() ? nullptr : carried->second;
+            const bool goesOn = !carrier && !lines.empty() && !lines.back().first;
+            size_t place = goesOn ? lines.size() - 1 : lines.size();
+            if (carrier) place = placeOf.emplace(carrier, place).first->second;
+            if (place == lines.size()) lines.push_back({carrier, {}});
+            lines[place].second.push_back(n);
+        }
+        for (const auto& [carrier, ofLine] : lines) {
+            VCardLine line;
+            line.name = "CATEGORIES";
+            line.value = vcardEncodeList(ofLine);
+            if (carrier) take(*carrier, line);
+            emit(std::move(line));
+        }
     }
 
     void writePerson() {
         emitUID();
-        if (_p[kCXIsCompanyProperty].boolean()) emit(_v4 ? "KIND" : "X-ROLVANE-KIND", "org");
+        emitKind();
         emitSingle("FN", true);
         VCardLine name = single("N");
         if (name.value.empty() && !_v4) name.value = ";;;;";
@@ -262,7 +317,7 @@ private:
         VCardLine line;
         line.name = field.lineName;
         line.value = *raw;
-        const Carrier* carrier = carrierFor(line, entry.label);
+        const Carrier* carrier = carrierFor(line.name, line.value, entry.label);
         if (carrier) {
             take(*carrier, line);
         } else {
@@ -322,12 +377,12 @@ private:
 
     void writeGroup() {
         emitUID();
-        emit(_v4 ? "KIND" : "X-ROLVANE-KIND", "group");
+        emitKind();
         emitSingle("FN", true);
         if (!_v4) emit("N", vcardEncodeSingle("FN", _p, true) + ";;;;");
         emitSingle("NOTE");
-        for (const auto& m : _entity.members) emit(_v4 ? "MEMBER" : "X-ROLVANE-MEMBER", vcardEscape(m));
-        for (const auto& g : _entity.subgroups) emit("X-ROLVANE-SUBGROUP", vcardEscape(g));
+        for (const auto& m : _entity.members) emitMember(_v4 ? "MEMBER" : "X-ROLVANE-MEMBER", m);
+        for (const auto& g : _entity.subgroups) emitMember("X-ROLVANE-SUBGROUP", g);
         for (const auto& c : _entity.choices) {
             VCardLine line;
             line.name = "X-ROLVANE-CHOICE";
@@ -362,6 +417,8 @@ private:
     bool _v4;
     std::vector<VCardLine> _lines, _plain;
     std::vector<Carrier> _carriers;
+    std::unordered_map<std::string, Alike> _alike;     // by keyOf
+    std::map<std::string, const Carrier*> _ofCategory; // by a name in it
     std::set<std::string> _groupNames;
     std::set<std::string> _labelledBesides; // groups with a kept line that would label them
     std::set<std::string> _labelled;        // groups whose label is written

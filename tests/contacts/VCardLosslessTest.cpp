@@ -6,6 +6,7 @@
 #include "contacts/VCardFields.h"
 #include "contacts/VCardText.h"
 #include "foundation/PropertyList.h"
+#include "support/CpuTime.h"
 
 #include <gtest/gtest.h>
 
@@ -274,6 +275,100 @@ TEST(VCardLossless, ACardSetsNothingThatIsWrittenByRulesOfItsOwn) {
         EXPECT_FALSE(e.properties[property]) << property;
         expectComesBack(e);
     }
+}
+
+TEST(VCardLossless, ParametersOfCategoriesStayWithTheNamesThatAreStillThere) {
+    auto e = readOne("FN:x\r\nCATEGORIES:Home\r\nCATEGORIES;TYPE=work;X-A=1:Mill,Board\\, old\r\nCATEGORIES:Club\r\n");
+    EXPECT_EQ(e.categories, (Lines{"Home", "Mill", "Board, old", "Club"}));
+    EXPECT_EQ(extras(e), Lines{"+CATEGORIES;TYPE=work;X-A=1:Mill,Board\\, old"});
+    expectComesBack(e);
+    e.categories = {"Board, old", "Home"};
+    EXPECT_TRUE(bothVersionsContain(e, "\r\nCATEGORIES;TYPE=work;X-A=1:Board\\, old\r\nCATEGORIES:Home\r\n"));
+    e.categories = {"Home"};
+    EXPECT_FALSE(bothVersionsContain(e, "X-A=1"));
+    expectComesBack(readOne("FN:x\r\na.CATEGORIES:Mill\r\na.X-COLOUR:red\r\n"));
+}
+
+TEST(VCardLossless, ParametersOfTheKindAreKeptWhileItIsThatKind) {
+    for (const char* kind : {"org", "individual"}) {
+        auto e = readOne("FN:x\r\nKIND;X-A=1:" + std::string(kind) + "\r\nX-Y-KIND;X-B=2:" + kind + "\r\n");
+        EXPECT_EQ(extras(e), (Lines{"+KIND;X-A=1:" + std::string(kind), "X-Y-KIND;X-B=2:" + std::string(kind)}));
+        expectComesBack(e);
+        EXPECT_NE(vcardText(e, VCardVersion::v4).find("\r\nKIND;X-A=1:" + std::string(kind)), std::string::npos);
+    }
+    auto company = readOne("FN:x\r\nKIND;X-A=1:organization\r\n");
+    expectComesBack(company);
+    company.properties.remove(kCXIsCompanyProperty);
+    EXPECT_FALSE(bothVersionsContain(company, "KIND")) << "it is another kind now";
+    expectComesBack(readOne("FN:x\r\nKIND;X-A=1:group\r\n"));
+}
+
+TEST(VCardLossless, ParametersOfAMemberAreKeptAsLongAsItIsOne) {
+    auto e = readOne("FN:x\r\nKIND:group\r\nMEMBER;X-ROLE=chair:urn:uuid:ABCDEF00-0000-4000-8000-000000000001\r\n"
+                     "MEMBER:mailto:jo@x\r\nMEMBER;PREF=1;VALUE=uri:mailto:al@x\r\n");
+    EXPECT_EQ(extras(e), (Lines{"+MEMBER;PREF=1:mailto:al@x",
+                                "+MEMBER;X-ROLE=chair:urn:uuid:ABCDEF00-0000-4000-8000-000000000001"}));
+    expectComesBack(e);
+    e.members = {"urn:uuid:abcdef00-0000-4000-8000-000000000001"};
+    EXPECT_TRUE(bothVersionsContain(e, "MEMBER;X-ROLE=chair:urn:uuid:abcdef00")) << "spelt in another way";
+    EXPECT_FALSE(bothVersionsContain(e, "PREF"));
+    std::swap(e.members, e.subgroups);
+    EXPECT_TRUE(bothVersionsContain(e, "X-ROLVANE-SUBGROUP;X-ROLE=chair:urn:uuid:abcdef00"));
+}
+
+TEST(VCardLossless, ATextOfMoreThanAMegabyteIsReadAgain) {
+    VCardEntity e;
+    e.properties.set(kCXNoteProperty, std::string(1 << 20, 'n') + "\nand more");
+    auto again = readText(vcardText(e, VCardVersion::v4));
+    ASSERT_EQ(again.entities.size(), 1u);
+    EXPECT_EQ(again.entities[0].properties[kCXNoteProperty], e.properties[kCXNoteProperty]);
+}
+
+// Lines whose values are not in the person's dictionary, with all that may stand before the colon.
+RC_GTEST_PROP(VCardLossless, WhatIsSaidBesidesKindCategoriesAndMembersComesBack, ()) {
+    const bool group = *rc::gen::arbitrary<bool>();
+    const auto anyOf = [](std::vector<std::string> texts) { return *rc::gen::elementOf(std::move(texts)); };
+    std::string lines = "FN:x\r\n";
+    if (group) lines += "KIND:group\r\n";
+    const int count = *rc::gen::inRange(0, 8);
+    for (int i = 0; i < count; i++) {
+        lines += anyOf({"", "", "a.", "b."});
+        const std::string parameters = anyOf({"", ";X-A=1", ";PREF=2", ";TYPE=work;X-B=\"a,b\"", ";VALUE=text"});
+        // A category is in a card once.
+        const std::string number = std::to_string(i);
+        switch (*rc::gen::inRange(0, 4)) {
+        case 0: lines += "KIND" + parameters + ":" + (group ? "group" : anyOf({"org", "individual"})); break;
+        case 1: lines += "X-OTHER-KIND" + parameters + ":" + (group ? "group" : "individual"); break;
+        case 2: lines += "CATEGORIES" + parameters + ":c" + number + anyOf({"", ",d" + number, "\\,e"}); break;
+        default: lines += (group ? "MEMBER" : "X-PET") + parameters + ":urn:x:" + anyOf({"1", "2", number}); break;
+        }
+        lines += "\r\n";
+    }
+    expectComesBack(readOne(lines));
+    RC_ASSERT(!::testing::Test::HasFailure());
+}
+
+// Each of them would be taken for the kind once the one before it is out of the way.
+VCardEntity personOfManyKinds(int kinds) {
+    VCardEntity e;
+    e.properties.set(kCXLastNameProperty, "Many");
+    Array kept;
+    for (int i = 0; i < kinds; i++) kept.append("X-A" + std::to_string(i) + "-KIND;X-B=1:individual");
+    e.properties.set(kCXVCardExtraProperty, kept);
+    return e;
+}
+
+TEST(VCardLossless, LinesThatTakeEachOthersPlaceAreWrittenInTimeProportionalToTheirNumber) {
+    std::string last = personOfManyKinds(12).properties[kCXVCardExtraProperty].array()[11].string();
+    EXPECT_TRUE(bothVersionsContain(personOfManyKinds(12), "X-ROLVANE-KEPT:" + vcardEscape(last)));
+    const auto seconds = [](int kinds) {
+        const VCardEntity e = personOfManyKinds(kinds);
+        return test::leastCpuSeconds([&](auto start) {
+            start();
+            EXPECT_FALSE(vcardText(e, VCardVersion::v4).empty());
+        });
+    };
+    EXPECT_LT(seconds(800), 8 * seconds(200)) << "16 times as much when each costs a card";
 }
 
 } // namespace
