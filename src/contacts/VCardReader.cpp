@@ -9,6 +9,7 @@
 #include "foundation/PropertyList.h"
 
 #include <algorithm>
+#include <iterator>
 #include <map>
 #include <set>
 
@@ -127,18 +128,25 @@ private:
         return carrySingle(line, "KIND");
     }
 
+    // A name is said once; a line that says nothing but names that were said is kept for what else is in it.
     bool takeCategories(const VCardLine& line) {
-        auto names = vcardDecodeList(line);
+        std::vector<std::string> fresh;
+        for (auto& name : vcardDecodeList(line))
+            if (!name.empty() && _categories.insert(name).second) fresh.push_back(std::move(name));
+        if (fresh.empty()) {
+            if (saysMore(line)) keep(line);
+            return true;
+        }
         use(line.group);
-        if (saysMore(line) && !names.empty()) _listCarriers.push_back({&line, "CATEGORIES", vcardEncodeList(names)});
-        _entity.categories.insert(_entity.categories.end(), names.begin(), names.end());
+        if (saysMore(line)) _listCarriers.push_back({&line, "CATEGORIES", vcardEncodeList(fresh)});
+        std::move(fresh.begin(), fresh.end(), std::back_inserter(_entity.categories));
         return true;
     }
 
     bool takeMember(const VCardLine& line, std::vector<std::string>& members) {
         members.emplace_back(vcardTrim(vcardUnescape(line.value)));
         use(line.group);
-        if (saysMore(line)) _listCarriers.push_back({&line, "MEMBER", vcardEscape(members.back())});
+        if (saysMore(line)) _listCarriers.push_back({&line, "MEMBER", vcardMemberKey(members.back())});
         return true;
     }
 
@@ -463,6 +471,7 @@ private:
     std::map<std::string, int, std::less<>> _groupUse;
     std::map<std::string, std::vector<Entry>, std::less<>> _multi;
     std::set<std::string, std::less<>> _seen;
+    std::set<std::string> _categories;
     std::vector<std::pair<std::string, const VCardLine*>> _exact;
     std::vector<std::pair<const VCardLine*, std::string>> _singleCarriers; // with the names that are written
     std::vector<ListCarrier> _listCarriers;
@@ -474,6 +483,10 @@ private:
 
 std::optional<VCardEntity> vcardEntityFromCard(const VCard& card, VCardError& error) {
     return Reader(card, error).read();
+}
+
+std::string vcardMemberKey(std::string_view uid) {
+    return vcardLower(vcardUUIDForUID(uid));
 }
 
 std::string vcardUIDForUUID(std::string_view uuid) {

@@ -31,8 +31,8 @@ struct VCardChoice {
 // - a content line behind "+" carries parameters and the group of a line that the dictionary does express
 //   ("+TEL;TYPE=car;PREF=1;X-ROLVANE-LABEL=Car:+44 1"); it is used as long as that value and label are there. The value
 //   is the one that is written (a PHOTO's: vcardEncodeSingle); parts behind those of an ADR or N are its parameter
-//   X-ROLVANE-REST. Of CATEGORIES the names that are still there keep it, of a MEMBER whoever the UID means, a group
-//   in the group among them.
+//   X-ROLVANE-REST. Of CATEGORIES the names that are still there keep it, of a MEMBER whoever vcardMemberKey means, a
+//   group in the group among them.
 struct VCardEntity {
     bool isGroup = false;
     std::string uid; // UID text as in the card, "" for none
@@ -45,6 +45,9 @@ struct VCardEntity {
 
 // Reads a scanned card. Nothing when it is a bad one; `error` then has line and reason. Pure; any thread.
 std::optional<VCardEntity> vcardEntityFromCard(const VCard& card, VCardError& error);
+
+// Whoever a UID text means, however it is spelt.
+std::string vcardMemberKey(std::string_view uid);
 
 // The UID text of a record identifier ("urn:uuid:<UUID>") and the UUID part of the record for a UID text.
 std::string vcardUIDForUUID(std::string_view uuid);

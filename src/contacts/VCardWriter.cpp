@@ -145,9 +145,7 @@ private:
         for (const auto& c : _carriers) {
             if (c.line.name == "CATEGORIES")
                 for (const auto& name : vcardDecodeList(c.line)) _ofCategory.emplace(name, &c);
-            const bool member = c.line.name == "MEMBER";
-            _alike[keyOf(c.line.name, member ? memberKey(vcardUnescape(c.line.value)) : c.line.value, c.label)]
-                .all.push_back(&c);
+            _alike[keyOf(c.line.name, c.line.value, c.label)].all.push_back(&c);
         }
     }
 
@@ -155,9 +153,6 @@ private:
         std::string key(name); // no line has a line feed in it
         return key.append("\n").append(label).append("\n").append(value);
     }
-
-    // Whoever the UID means, however it is spelt.
-    static std::string memberKey(std::string_view uid) { return vcardLower(vcardUUIDForUID(uid)); }
 
     static int preferenceOf(const VCardLine& line) {
         const VCardParameter* p = line.parameter("PREF");
@@ -198,7 +193,7 @@ private:
         VCardLine line;
         line.name = name;
         line.value = vcardEscape(uid);
-        if (const Carrier* c = carrierFor("MEMBER", memberKey(uid), "")) take(*c, line);
+        if (const Carrier* c = carrierFor("MEMBER", vcardMemberKey(uid), "")) take(*c, line);
         emit(std::move(line));
     }
 

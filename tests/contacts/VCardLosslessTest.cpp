@@ -286,6 +286,7 @@ TEST(VCardLossless, ParametersOfCategoriesStayWithTheNamesThatAreStillThere) {
     EXPECT_TRUE(bothVersionsContain(e, "\r\nCATEGORIES;TYPE=work;X-A=1:Board\\, old\r\nCATEGORIES:Home\r\n"));
     e.categories = {"Home"};
     EXPECT_FALSE(bothVersionsContain(e, "X-A=1"));
+    expectComesBack(readOne("FN:x\r\nCATEGORIES:A\r\nCATEGORIES;X-A=1:A,B,,B\r\nCATEGORIES;X-A=2:B\r\n"));
     expectComesBack(readOne("FN:x\r\na.CATEGORIES:Mill\r\na.X-COLOUR:red\r\n"));
 }
 
@@ -306,8 +307,8 @@ TEST(VCardLossless, ParametersOfTheKindAreKeptWhileItIsThatKind) {
 TEST(VCardLossless, ParametersOfAMemberAreKeptAsLongAsItIsOne) {
     auto e = readOne("FN:x\r\nKIND:group\r\nMEMBER;X-ROLE=chair:urn:uuid:ABCDEF00-0000-4000-8000-000000000001\r\n"
                      "MEMBER:mailto:jo@x\r\nMEMBER;PREF=1;VALUE=uri:mailto:al@x\r\n");
-    EXPECT_EQ(extras(e), (Lines{"+MEMBER;PREF=1:mailto:al@x",
-                                "+MEMBER;X-ROLE=chair:urn:uuid:ABCDEF00-0000-4000-8000-000000000001"}));
+    EXPECT_EQ(extras(e), (Lines{"+MEMBER;PREF=1:" + vcardMemberKey("mailto:al@x"),
+                                "+MEMBER;X-ROLE=chair:abcdef00-0000-4000-8000-000000000001"}));
     expectComesBack(e);
     e.members = {"urn:uuid:abcdef00-0000-4000-8000-000000000001"};
     EXPECT_TRUE(bothVersionsContain(e, "MEMBER;X-ROLE=chair:urn:uuid:abcdef00")) << "spelt in another way";
@@ -334,13 +335,18 @@ RC_GTEST_PROP(VCardLossless, WhatIsSaidBesidesKindCategoriesAndMembersComesBack,
     for (int i = 0; i < count; i++) {
         lines += anyOf({"", "", "a.", "b."});
         const std::string parameters = anyOf({"", ";X-A=1", ";PREF=2", ";TYPE=work;X-B=\"a,b\"", ";VALUE=text"});
-        // A category is in a card once.
         const std::string number = std::to_string(i);
         switch (*rc::gen::inRange(0, 4)) {
         case 0: lines += "KIND" + parameters + ":" + (group ? "group" : anyOf({"org", "individual"})); break;
         case 1: lines += "X-OTHER-KIND" + parameters + ":" + (group ? "group" : "individual"); break;
-        case 2: lines += "CATEGORIES" + parameters + ":c" + number + anyOf({"", ",d" + number, "\\,e"}); break;
-        default: lines += (group ? "MEMBER" : "X-PET") + parameters + ":urn:x:" + anyOf({"1", "2", number}); break;
+        case 2:
+            lines += "CATEGORIES" + parameters + ":c" + number + anyOf({"", ",d" + number, "\\,e", ",c1", ",,"});
+            break;
+        default:
+            lines += (group ? "MEMBER" : "X-PET") + parameters + ":" +
+                     anyOf({"urn:x:1", "urn:uuid:abcdef00-0000-4000-8000-00000000000a",
+                            "urn:uuid:ABCDEF00-0000-4000-8000-00000000000A"});
+            break;
         }
         lines += "\r\n";
     }
