@@ -124,6 +124,18 @@ inline ReadBack readText(const std::string& text) {
     return result;
 }
 
+// One card of the lines.
+inline ReadBack readCard(const std::string& lines, const std::string& version) {
+    return readText("BEGIN:VCARD\r\nVERSION:" + version + "\r\n" + lines + "END:VCARD\r\n");
+}
+
+// A good one; else the test fails.
+inline VCardEntity readOneCard(const std::string& lines, const std::string& version) {
+    auto r = readCard(lines, version);
+    for (const auto& e : r.errors) ADD_FAILURE() << e.description();
+    return r.entities.size() == 1 ? r.entities[0] : VCardEntity{};
+}
+
 // Identifiers of multi-value entries belong to one database; everything else must be equal.
 inline Dictionary withoutIdentifiers(const Dictionary& d) {
     Dictionary out;

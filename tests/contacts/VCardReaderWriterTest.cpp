@@ -12,13 +12,11 @@ namespace {
 using namespace vcardtest;
 
 VCardEntity readOne(const std::string& lines, const std::string& version = "3.0") {
-    auto r = readText("BEGIN:VCARD\r\nVERSION:" + version + "\r\n" + lines + "END:VCARD\r\n");
-    for (const auto& e : r.errors) ADD_FAILURE() << e.description();
-    return r.entities.size() == 1 ? r.entities[0] : VCardEntity{};
+    return readOneCard(lines, version);
 }
 
 std::string reasonFor(const std::string& lines, const std::string& version = "3.0") {
-    auto r = readText("BEGIN:VCARD\r\nVERSION:" + version + "\r\n" + lines + "END:VCARD\r\n");
+    auto r = readCard(lines, version);
     return r.entities.empty() && r.errors.size() == 1 ? r.errors[0].reason : "(no error)";
 }
 
