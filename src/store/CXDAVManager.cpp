@@ -56,6 +56,15 @@ CXDAVManager::Impl::Impl(CXDAVAccount account, std::shared_ptr<HttpTransport> tr
       files(session, tokens, versions), structure(session, files), accessLists(session),
       ownTree(treeOf(session.account())) {}
 
+StoreListing::AskedRef CXDAVManager::Impl::begun(const Url& container) {
+    const std::lock_guard guard(begunLock);
+    const auto found = begunListings.find(container.absoluteString());
+    if (found == begunListings.end()) return nullptr;
+    auto listing = std::move(found->second);
+    begunListings.erase(found);
+    return listing;
+}
+
 CXDAVManager::CXDAVManager(CXDAVAccount account) : CXDAVManager(std::move(account), VersionsFile()) {}
 
 CXDAVManager::CXDAVManager(CXDAVAccount account, VersionsFile versions) {
@@ -134,12 +143,12 @@ Value CXDAVManager::configValueForKey(const std::string& key, Value defaultValue
 
 // ---- one client
 
-bool CXDAVManager::canReach(CXDAVError& error) {
+bool CXDAVManager::canReach(CXDAVError& error, const std::function<void()>& meanwhile) {
     if (account().user.empty()) {
         error = {kCXDAVErrorNoAccount, "There is no account. Set one with: rolvane account set"};
         return false;
     }
-    return _impl->session.canReach(error);
+    return _impl->session.canReach(error, meanwhile);
 }
 
 bool CXDAVManager::write(const std::string& text, const Url& url, bool securely) {
@@ -182,7 +191,11 @@ bool CXDAVManager::createDirectoryAtAURL(const Url& url) {
 }
 
 std::optional<FileListing> CXDAVManager::infoForFilesInContainer(const Url& url) {
-    auto listing = StoreListing(_impl->session, _impl->versions, _impl->listings).list(url);
+    return infoForFilesInContainerByParts(url, nullptr);
+}
+
+std::optional<FileListing> CXDAVManager::infoForFilesInContainerByParts(const Url& url, const ListingPart& part) {
+    auto listing = StoreListing(_impl->session, _impl->versions, _impl->listings).list(url, _impl->begun(url), part);
     if (!listing) return listing;
     for (const auto& [path, file] : *listing) {
         if (!file.displayName.ends_with("CXGroup")) continue;
@@ -195,6 +208,22 @@ std::optional<FileListing> CXDAVManager::infoForFilesInContainer(const Url& url)
 
 void CXDAVManager::expectReads(const std::vector<Url>& urls, bool securely) {
     _impl->files.expectReads(urls, securely);
+}
+
+void CXDAVManager::expectSomeReads(const std::vector<Url>& urls, bool securely) {
+    _impl->files.expectSomeReads(urls, securely);
+}
+
+void CXDAVManager::expectListing(const Url& url) {
+    auto begun = StoreListing(_impl->session, _impl->versions, _impl->listings).begin(url);
+    const std::lock_guard guard(_impl->begunLock);
+    _impl->begunListings.insert_or_assign(url.absoluteString(), std::move(begun));
+}
+
+void CXDAVManager::expectNothing() {
+    _impl->files.expectNoReads();
+    const std::lock_guard guard(_impl->begunLock);
+    _impl->begunListings.clear();
 }
 
 CXDAVManager::Snapshot::Snapshot(CXDAVManager& manager) : _impl(manager._impl) {

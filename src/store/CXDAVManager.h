@@ -76,7 +76,8 @@ public:
     static Value configValueForKey(const std::string& key, Value defaultValue);
 
     // -- the same for one client
-    bool canReach(CXDAVError& error);
+    // `meanwhile`: called when the requests that find it out can be sent, for others to go along with them.
+    bool canReach(CXDAVError& error, const std::function<void()>& meanwhile = {});
     const CXDAVAccount& account() const;
     HttpTransport& transport();
 
@@ -90,7 +91,13 @@ public:
     bool removeDirectoryAndContentsAtURL(const Url& url) override;
     bool createDirectoryAtAURL(const Url& url); // true when it is there afterwards
     std::optional<FileListing> infoForFilesInContainer(const Url& url) override;
+    std::optional<FileListing> infoForFilesInContainerByParts(const Url& url, const ListingPart& part) override;
     void expectReads(const std::vector<Url>& urls, bool securely) override;
+    void expectSomeReads(const std::vector<Url>& urls, bool securely) override;
+    // The container is going to be listed once, soon: what is asked first of the store is asked now.
+    void expectListing(const Url& url);
+    // Nothing is expected any more, listings included; what was fetched ahead is forgotten.
+    void expectNothing();
 
     // While one lives, dictionaryAtURL of a group whose file is, in a listing made meanwhile, still the version that
     // this client read or wrote last gives that content without asking the store. One at a time.

@@ -9,6 +9,9 @@
 #include "store/StoreSession.h"
 #include "store/VersionMemory.h"
 
+#include <map>
+#include <mutex>
+
 namespace rolvane {
 
 // What a client is made of, in the order in which its parts need one another.
@@ -24,6 +27,10 @@ struct CXDAVManager::Impl {
     PublishStructure structure;
     StoreAccessLists accessLists;
     const std::string ownTree; // what every name below the account's own tree begins with
+
+    std::mutex begunLock;
+    std::map<std::string, StoreListing::AskedRef> begunListings; // by container; guarded by begunLock
+    StoreListing::AskedRef begun(const Url& container);          // hands it out; null when there is none
 };
 
 } // namespace rolvane

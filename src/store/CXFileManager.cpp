@@ -79,6 +79,11 @@ bool CXFileManager::removeDirectoryAndContentsAtURL(const Url& url) {
 }
 
 void CXFileManager::expectReads(const std::vector<Url>& /*urls*/, bool /*securely*/) {}
+void CXFileManager::expectSomeReads(const std::vector<Url>& /*urls*/, bool /*securely*/) {}
+
+std::optional<FileListing> CXFileManager::infoForFilesInContainerByParts(const Url& url, const ListingPart& /*part*/) {
+    return infoForFilesInContainer(url);
+}
 
 std::optional<FileListing> CXFileManager::infoForFilesInContainer(const Url& url) {
     if (isRemote(url)) return CXDAVManager::defaultManager().infoForFilesInContainer(url);

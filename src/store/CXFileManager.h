@@ -52,10 +52,16 @@ public:
     // The dictionaries at these URLs are going to be read, with `securely`, in this order: what can be fetched ahead
     // is. Each is used for the first reading only. An empty list ends it. Base: nothing is fetched ahead.
     virtual void expectReads(const std::vector<Url>& urls, bool securely);
+    // These, too, but in an order that a later expectReads tells; what could not be begun by then is read in its turn.
+    virtual void expectSomeReads(const std::vector<Url>& urls, bool securely);
     // What lies in the container, complete or nothing. A remote base location also lists the contact files in the
     // buckets below its "People"; other containers list their own entries only. Entries with hostile names are left
     // out, as are local links, pipes and devices.
     virtual std::optional<FileListing> infoForFilesInContainer(const Url& url);
+    // The same; parts of it are told on the way, each entry at most once, perhaps none. Nothing may be concluded from
+    // what is missing in them, nor from anything in them when there is no listing in the end.
+    using ListingPart = std::function<void(const FileListing& part)>;
+    virtual std::optional<FileListing> infoForFilesInContainerByParts(const Url& url, const ListingPart& part);
 
     // Called, on the thread that needed it, when the network store's password cannot be obtained. One a process; an
     // empty function takes it away.

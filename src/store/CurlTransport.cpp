@@ -3,6 +3,7 @@
 #include "store/CurlSlot.h"
 #include "store/HttpTransport.h"
 
+#include <algorithm>
 #include <condition_variable>
 #include <deque>
 #include <mutex>
@@ -99,6 +100,7 @@ struct CurlTransport::Impl {
     void run();
     void wait();
     void takeInbox();
+    void line(std::unique_ptr<HttpJob> job, bool again);
     void dropAborted();
     void admit();
     bool heldBack(SteadyTime now);
@@ -128,7 +130,7 @@ struct CurlTransport::Impl {
     std::atomic<uint64_t> requests{0}, connections{0}, challenged{0}, heldBackCount{0};
 
     // The transport's thread only
-    std::deque<std::unique_ptr<HttpJob>> pending;
+    std::deque<std::unique_ptr<HttpJob>> pending; // those that give way behind the others
     std::vector<std::unique_ptr<CurlSlot>> slots;
     std::vector<CurlSlot*> idle;
     std::unordered_set<CurlSlot*> active;
@@ -289,8 +291,19 @@ void CurlTransport::Impl::takeInbox() {
         if (job->epoch < abortEpoch)
             fail(std::move(job), TransportError::aborted, "The program is ending.");
         else
-            pending.push_back(std::move(job));
+            line(std::move(job), false);
     }
+}
+
+// Behind those that go before it or have come earlier; `again`: before those of its own kind.
+void CurlTransport::Impl::line(std::unique_ptr<HttpJob> job, bool again) {
+    const bool givesWay = job->request.givesWay;
+    const auto border = std::partition_point(pending.begin(), pending.end(),
+                                             [](const auto& other) { return !other->request.givesWay; });
+    if (again == givesWay)
+        pending.insert(border, std::move(job));
+    else
+        pending.insert(again ? pending.begin() : pending.end(), std::move(job));
 }
 
 // Abandons what was handed over before the latest abortAll.
@@ -381,7 +394,7 @@ void CurlTransport::Impl::finished(CurlSlot& slot, CURLcode code) {
     // libcurl may drop the answer then; over HTTP/1.1 it comes through.
     if (code == CURLE_HTTP2_STREAM && !job->headerDone && !job->http1Only && job->verdict == TransportError::none) {
         job->http1Only = true;
-        pending.push_front(std::move(job));
+        line(std::move(job), true);
         return;
     }
     const bool refusedEarly = code == CURLE_HTTP2_STREAM && job->headerDone && job->response.status >= 400;
@@ -415,7 +428,7 @@ bool CurlTransport::Impl::sendAgain(std::unique_ptr<HttpJob>& job) {
         return false;
     }
     ++job->repetitions;
-    pending.push_front(std::move(job));
+    line(std::move(job), true);
     return true;
 }
 

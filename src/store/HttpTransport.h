@@ -44,6 +44,8 @@ struct HttpRequest {
     // request with `tooLarge`. Called on the transport's thread, only for the status `sinkStatus`.
     std::function<bool(std::string_view)> sink;
     int sinkStatus = 207;
+    // Nobody waits for it yet: while there is no connection for all, those without this go first.
+    bool givesWay = false;
 };
 
 struct HttpResponse {

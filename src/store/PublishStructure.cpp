@@ -107,7 +107,9 @@ bool PublishStructure::makeTree() {
 }
 
 HttpRequest PublishStructure::making(const Url& collection) const {
-    return StoreSession::request("MKCOL", *_session.endpoint(collection));
+    HttpRequest request = StoreSession::request("MKCOL", *_session.endpoint(collection));
+    request.givesWay = true; // a pass that reads other people's trees need not wait for it
+    return request;
 }
 
 // A file that must not replace another one.
@@ -115,6 +117,7 @@ HttpRequest PublishStructure::writingNew(const Url& name, const std::string& tex
     HttpRequest request = StoreSession::request("PUT", *_session.endpoint(name));
     request.headers = {{"If-None-Match", "*"}, {"Content-Type", "application/xml; charset=utf-8"}};
     request.body = std::make_shared<const std::string>(text);
+    request.givesWay = true;
     return request;
 }
 

@@ -4,17 +4,14 @@
 
 namespace rolvane {
 
-namespace {
-
-HttpRequest getting(const std::string& url) {
+HttpRequest ReadAhead::getting(const std::string& url) {
     HttpRequest request;
     request.method = "GET";
     request.url = Url(url);
-    request.limits.maxBodyBytes = ReadAhead::kLargestAnswer;
+    request.limits.maxBodyBytes = kLargestAnswer;
+    request.givesWay = true;
     return request;
 }
-
-} // namespace
 
 struct ReadAhead::Window {
     std::mutex mutex;

@@ -35,6 +35,9 @@ public:
     // The file changes: what was fetched of it is no longer true.
     void forget(const Url& url);
 
+    // The request for one; what somebody waits for goes before it.
+    static HttpRequest getting(const std::string& url);
+
 private:
     struct Window; // shared with the requests under way
     void refill(const std::shared_ptr<Window>& window);

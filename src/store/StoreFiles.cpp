@@ -91,10 +91,11 @@ std::string contentType(const std::string& text) {
 
 StoreFiles::StoreFiles(StoreSession& session, LockTokens& tokens, VersionMemory& versions)
     : _session(session), _tokens(tokens), _versions(versions),
-      _ahead([&session](HttpRequest request, HttpTransport::Completion done) {
+      _startReading([&session](HttpRequest request, HttpTransport::Completion done) {
+          request.givesWay = !mayBeBoth(request.url); // groups are needed before any contact
           session.start(std::move(request), std::move(done));
       }),
-      _reader(nextReader()) {}
+      _early(_startReading), _ahead(_startReading), _reader(nextReader()) {}
 
 bool StoreFiles::isReservedName(std::string_view name) {
     return name == CXDAVManager::kStateName || name.ends_with(kMakingSuffix);
@@ -119,7 +120,8 @@ void StoreFiles::forget(const Url& url) {
 // ---- reading
 
 StoreFiles::Fetched StoreFiles::fetch(const Url& url, bool mayBeCollection) {
-    std::optional<HttpResponse> waiting = _ahead.take(url);
+    std::optional<HttpResponse> waiting = _early.take(url);
+    if (!waiting) waiting = _ahead.take(url);
     HttpResponse answer =
         waiting ? _session.judged(std::move(*waiting)) : _session.send(StoreSession::request("GET", url));
     // httpd says 403 of a file that is replaced or removed while it is being opened, too: only what is said twice
@@ -233,10 +235,26 @@ StoreFiles::Reading StoreFiles::read(const Url& name, bool securely) {
 void StoreFiles::expectReads(const std::vector<Url>& names, bool securely) {
     std::vector<Url> urls;
     urls.reserve(names.size());
-    for (const Url& name : names)
-        if (const auto url = _session.endpoint(name, securely))
-            urls.push_back(mayBeBoth(name) && knownCollection(*url) ? stateURL(*url) : *url);
+    for (const Url& name : names) {
+        const auto url = _session.endpoint(name, securely);
+        if (!url) continue;
+        Url place = mayBeBoth(name) && knownCollection(*url) ? stateURL(*url) : *url;
+        if (!_early.claim(place)) urls.push_back(std::move(place));
+    }
     _ahead.expect(urls);
+}
+
+void StoreFiles::expectSomeReads(const std::vector<Url>& names, bool securely) {
+    std::vector<Url> urls;
+    urls.reserve(names.size());
+    for (const Url& name : names)
+        if (auto url = _session.endpoint(name, securely)) urls.push_back(std::move(*url));
+    _early.add(urls);
+}
+
+void StoreFiles::expectNoReads() {
+    _early.clear();
+    _ahead.expect({});
 }
 
 void StoreFiles::foundCollection(const Url& name) {
@@ -276,6 +294,7 @@ int StoreFiles::put(const Url& name, const Url& target, const std::shared_ptr<co
     request.headers = std::move(headers);
     request.body = body;
     const HttpResponse answer = _session.send(std::move(request));
+    _early.forget(target);
     _ahead.forget(target);
     if (answer.ok()) {
         const std::string* tag = answer.header("etag");
@@ -320,6 +339,7 @@ int StoreFiles::remove(const Url& name) {
     forget(*url);
     _versions.forget(name.absoluteString());
     _copies.forget(name.absoluteString());
+    _early.forget(*url);
     _ahead.forget(*url);
     HttpRequest request = StoreSession::request("DELETE", *url);
     const LockToken token = _tokens.tokenFor(url->absoluteString());

@@ -1,6 +1,7 @@
 #pragma once
 
 #include "foundation/Value.h"
+#include "store/EarlyReads.h"
 #include "store/GroupCopies.h"
 #include "store/LockTokens.h"
 #include "store/ReadAhead.h"
@@ -30,6 +31,9 @@ public:
     Reading read(const Url& name, bool securely);
     // These are going to be read, in this order (see ReadAhead).
     void expectReads(const std::vector<Url>& names, bool securely);
+    // These are, too, in an order that is told later (see EarlyReads).
+    void expectSomeReads(const std::vector<Url>& names, bool securely);
+    void expectNoReads();
     // A listing has shown that the group is a collection: its state is looked for inside first.
     void foundCollection(const Url& name);
     // The groups' dictionaries whose version is the one that this client knows; consulted by `read` during a snapshot.
@@ -75,6 +79,8 @@ private:
     StoreSession& _session;
     LockTokens& _tokens;
     VersionMemory& _versions;
+    const ReadAhead::Start _startReading;
+    EarlyReads _early;
     ReadAhead _ahead;
     GroupCopies _copies;
     const uint64_t _reader;                       // tells this object from every other one of the process

@@ -4,6 +4,9 @@
 #include "store/StoreFiles.h"
 
 #include <algorithm>
+#include <condition_variable>
+#include <deque>
+#include <mutex>
 
 namespace rolvane {
 
@@ -43,46 +46,94 @@ bool isBaseLocation(const Url& name) {
 
 } // namespace
 
-std::vector<StoreListing::Members> StoreListing::members(const std::vector<Url>& containers, const Url* tagged) {
+// The answers are handed over as they came, and judged on the thread that reads them.
+struct StoreListing::Asked {
+    std::vector<Url> containers;
     std::vector<std::shared_ptr<Staged>> staged;
+    std::vector<HttpResponse> answers; // each written once, before its number stands among the arrived ones
+    std::mutex mutex;
+    std::condition_variable changed;
+    std::deque<size_t> arrived; // guarded by the mutex
+
+    void arrive(size_t number, HttpResponse answer) {
+        const std::lock_guard guard(mutex);
+        answers[number] = std::move(answer);
+        arrived.push_back(number);
+        changed.notify_all();
+    }
+    // Waits for another answer. As often as there are containers.
+    size_t next() {
+        std::unique_lock lock(mutex);
+        changed.wait(lock, [&] { return !arrived.empty(); });
+        const size_t number = arrived.front();
+        arrived.pop_front();
+        return number;
+    }
+};
+
+StoreListing::AskedRef StoreListing::ask(const std::vector<Url>& containers, const Url* tagged) {
+    auto asked = std::make_shared<Asked>();
     std::vector<HttpRequest> requests;
-    std::vector<Members> out(containers.size());
     for (const Url& name : containers) {
         const auto url = _session.endpoint(name);
-        if (!url) return out;
+        if (!url) return asked; // of none of them then
         HttpRequest r = StoreSession::propfind(Url(asDirectory(*url)), 1, tagged && *tagged == name);
         r.limits = {300, 60, kListingBytes, 64u << 10};
         auto reading = std::make_shared<Staged>();
         r.sink = [reading](std::string_view bytes) { return reading->sound = reading->reader.feed(bytes); };
-        staged.push_back(reading);
+        asked->staged.push_back(reading);
         requests.push_back(std::move(r));
     }
-    const auto answers = _session.sendAll(std::move(requests));
-    for (size_t i = 0; i < answers.size(); ++i) {
-        out[i].code = answers[i].status;
-        out[i].serverDate = serverDateOf(answers[i]);
-        if (answers[i].status != 207 || !staged[i]->sound) continue;
-        const auto entries = staged[i]->reader.finish();
-        if (!entries || entries->empty()) continue; // even an empty container names itself
-        const Url container = *_session.nameFor(_session.endpoint(containers[i])->absoluteString());
-        std::vector<std::pair<Url, MultistatusEntry>> inside;
-        bool namesItself = false, whole = true;
-        for (const MultistatusEntry& entry : *entries) {
-            const auto name = _session.nameFor(entry.href);
-            if (name && *name == container) {
-                namesItself = entry.isCollection;
-                continue;
-            }
-            if (!name || !isMember(*name, container)) {
-                CXLog("An entry with a strange name in the listing of %@ is left out.", container);
-                continue;
-            }
-            if (entry.status == 404) continue; // removed while the listing was made
-            if (entry.status != 0 && entry.status != 200) whole = false;
-            inside.emplace_back(*name, entry);
+    asked->containers = containers;
+    asked->answers.resize(requests.size());
+    for (size_t i = 0; i < requests.size(); ++i)
+        _session.start(std::move(requests[i]),
+                       [asked, i](HttpResponse answer) { asked->arrive(i, std::move(answer)); });
+    return asked;
+}
+
+StoreListing::Members StoreListing::read(Asked& asked, size_t number) {
+    Members out;
+    const HttpResponse answer = _session.judged(std::move(asked.answers[number]));
+    const auto staged = std::move(asked.staged[number]);
+    out.code = answer.status;
+    out.serverDate = serverDateOf(answer);
+    if (answer.status != 207 || !staged->sound) return out;
+    const auto entries = staged->reader.finish();
+    if (!entries || entries->empty()) return out; // even an empty container names itself
+    const Url container = *_session.nameFor(_session.endpoint(asked.containers[number])->absoluteString());
+    std::vector<std::pair<Url, MultistatusEntry>> inside;
+    bool namesItself = false, whole = true;
+    for (const MultistatusEntry& entry : *entries) {
+        const auto name = _session.nameFor(entry.href);
+        if (name && *name == container) {
+            namesItself = entry.isCollection;
+            continue;
         }
-        if (namesItself && whole) out[i].entries = std::move(inside);
+        if (!name || !isMember(*name, container)) {
+            CXLog("An entry with a strange name in the listing of %@ is left out.", container);
+            continue;
+        }
+        if (entry.status == 404) continue; // removed while the listing was made
+        if (entry.status != 0 && entry.status != 200) whole = false;
+        inside.emplace_back(*name, entry);
     }
+    if (namesItself && whole) out.entries = std::move(inside);
+    return out;
+}
+
+std::vector<StoreListing::Members> StoreListing::readAll(Asked& asked) {
+    std::vector<Members> out(asked.containers.size());
+    for (size_t i = 0; i < out.size(); ++i) {
+        const size_t number = asked.next();
+        out[number] = read(asked, number);
+    }
+    return out;
+}
+
+std::vector<StoreListing::Members> StoreListing::members(const std::vector<Url>& containers) {
+    std::vector<Members> out = readAll(*ask(containers));
+    out.resize(containers.size());
     return out;
 }
 
@@ -135,7 +186,8 @@ bool StoreListing::addStates(const std::vector<Url>& groups, FileListing& out) {
 
 // The tags are told before the buckets are listed: what changes in between is in the listing already, and listed again
 // the next time.
-bool StoreListing::addBuckets(const Members& people, bool tagged, FileListing& out) {
+bool StoreListing::addBuckets(const Members& people, bool tagged, FileListing& out,
+                              const CXFileManager::ListingPart& part) {
     if (!people.entries) return false;
     std::vector<Url> none, names;
     std::vector<std::string> tags;
@@ -146,12 +198,19 @@ bool StoreListing::addBuckets(const Members& people, bool tagged, FileListing& o
         names.push_back(name);
         tags.push_back(tag);
     }
-    const auto buckets = members(names);
-    for (size_t i = 0; i < names.size(); ++i) {
-        if (!addEntries(buckets[i], out, none)) return false;
-        _listings.keep(names[i], tags[i], *buckets[i].entries);
+    const AskedRef asked = ask(names);
+    bool whole = asked->containers.size() == names.size();
+    for (size_t i = 0; i < asked->containers.size(); ++i) {
+        const size_t number = asked->next();
+        const Members bucket = read(*asked, number);
+        FileListing inside;
+        whole = addEntries(bucket, inside, none) && whole;
+        if (!bucket.entries) continue;
+        _listings.keep(names[number], tags[number], *bucket.entries);
+        if (whole && part) part(inside);
+        out.merge(inside);
     }
-    return true;
+    return whole;
 }
 
 bool StoreListing::addUnchanged(const Url& container, const std::string& tag, const std::optional<Date>& serverDate,
@@ -174,17 +233,23 @@ bool StoreListing::addUnchanged(const Url& container, const std::string& tag, co
     });
 }
 
-std::optional<FileListing> StoreListing::list(const Url& container) {
-    FileListing out;
-    std::vector<Url> groups, asked{container};
+StoreListing::AskedRef StoreListing::begin(const Url& container) {
+    std::vector<Url> asked{container};
     const Url people = container.cxURLByAppendingComponent("People");
     if (isBaseLocation(container)) asked.push_back(people); // nearly always there, and a way to the store saved
-    const bool tagged = _session.givesMembersTags();
-    const auto answers = members(asked, tagged ? &people : nullptr);
-    if (!addEntries(answers.front(), out, groups)) return std::nullopt;
+    return ask(asked, _session.mayGiveMembersTags() ? &people : nullptr);
+}
+
+std::optional<FileListing> StoreListing::list(const Url& container, const AskedRef& begun,
+                                              const CXFileManager::ListingPart& part) {
+    FileListing out;
+    std::vector<Url> groups;
+    const Url people = container.cxURLByAppendingComponent("People");
+    const auto answers = readAll(begun ? *begun : *begin(container));
+    if (answers.empty() || !addEntries(answers.front(), out, groups)) return std::nullopt;
     const auto found = out.find(pathOf(people));
-    const bool holdsPeople = asked.size() == 2 && found != out.end() && found->second.isCollection;
-    if (holdsPeople && !addBuckets(answers.back(), tagged, out)) return std::nullopt;
+    const bool holdsPeople = answers.size() == 2 && found != out.end() && found->second.isCollection;
+    if (holdsPeople && !addBuckets(answers.back(), _session.givesMembersTags(), out, part)) return std::nullopt;
     return addStates(groups, out) ? std::optional(std::move(out)) : std::nullopt;
 }
 

@@ -6,6 +6,7 @@
 #include "store/StoreSession.h"
 #include "store/VersionMemory.h"
 
+#include <memory>
 #include <optional>
 #include <vector>
 
@@ -23,8 +24,15 @@ public:
     // listing.
     static constexpr double kUnseenSeconds = 5;
 
-    // As CXFileManager::infoForFilesInContainer.
-    std::optional<FileListing> list(const Url& container);
+    // Containers that the store was asked to list, with the answers as they come.
+    struct Asked;
+    using AskedRef = std::shared_ptr<Asked>;
+    // What `list` of the container asks first. Does not wait.
+    AskedRef begin(const Url& container);
+    // As CXFileManager::infoForFilesInContainer; `begun`: goes on from there; `part`: as of
+    // infoForFilesInContainerByParts.
+    std::optional<FileListing> list(const Url& container, const AskedRef& begun = {},
+                                    const CXFileManager::ListingPart& part = {});
     // The names of the direct members of each container, with what they are. Nothing for a container that cannot be
     // listed; `codes` tells why.
     struct Members {
@@ -32,11 +40,14 @@ public:
         std::optional<std::vector<std::pair<Url, MultistatusEntry>>> entries; // by name; the container itself left out
         std::optional<Date> serverDate;
     };
-    // `tagged`: of that one's members the tags are asked for, too.
-    std::vector<Members> members(const std::vector<Url>& containers, const Url* tagged = nullptr);
+    std::vector<Members> members(const std::vector<Url>& containers);
 
 private:
-    bool addBuckets(const Members& people, bool tagged, FileListing& out);
+    // `tagged`: of that one's members the tags are asked for, too.
+    AskedRef ask(const std::vector<Url>& containers, const Url* tagged = nullptr);
+    Members read(Asked& asked, size_t number); // of an answer that has come
+    std::vector<Members> readAll(Asked& asked);
+    bool addBuckets(const Members& people, bool tagged, FileListing& out, const CXFileManager::ListingPart& part);
     bool addUnchanged(const Url& container, const std::string& tag, const std::optional<Date>& serverDate,
                       FileListing& out);
     bool addEntries(const Members& members, FileListing& out, std::vector<Url>& groupCollections);

@@ -224,7 +224,7 @@ CXDAVError StoreSession::errorFrom(const HttpResponse& answer, const char* asked
                                               " and is no WebDAV server. Check the account's endpoint."};
 }
 
-bool StoreSession::canReach(CXDAVError& error) {
+bool StoreSession::canReach(CXDAVError& error, const std::function<void()>& meanwhile) {
     error = {};
     bool needsLoginProof;
     {
@@ -236,6 +236,7 @@ bool StoreSession::canReach(CXDAVError& error) {
         error = {kCXDAVErrorNoPassword, "The password of the account cannot be had."};
         return false;
     }
+    if (meanwhile) meanwhile();
     // Servers may answer OPTIONS without looking at the login, so the login is proven once by a request that needs it.
     std::vector<HttpRequest> proof;
     if (const auto tree = endpoint(_account.baseLocationFor(_account.user)); tree && needsLoginProof)

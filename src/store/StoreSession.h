@@ -6,6 +6,7 @@
 
 #include <atomic>
 #include <chrono>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -39,13 +40,15 @@ public:
     HttpResponse judged(HttpResponse answer);
 
     // Whether the store can be used, see CXDAVManager::canReachOstrelError.
-    bool canReach(CXDAVError& error);
+    bool canReach(CXDAVError& error, const std::function<void()>& meanwhile = {});
     // Whether the server announces access lists (RFC 3744 section 7.2), as it last said; asked when it never did.
     // Nothing when it does not answer.
     std::optional<bool> keepsAccessLists();
     // Whether the server tells the state of a collection's members by a tag, as it last said: a property of that name
     // counts only where the server announces it, since elsewhere any writer could set it.
     bool givesMembersTags() const { return _membersTags; }
+    // The same, or it has not been asked yet.
+    bool mayGiveMembersTags() const { return _membersTags || _accessLists < 0; }
     // The password; absent, and the failed-password handler called, when it cannot be had.
     std::optional<std::string> password();
 
