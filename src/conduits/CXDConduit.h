@@ -37,7 +37,12 @@ public:
     ConduitEngine& engine() const { return _engine; }
     std::optional<Date> lastSyncDate() const { return _lastSyncDate; }
 
+    // A gathering begins: `open` and `changeRecords` follow, and what they ask of the source may be asked at once.
+    // Base: nothing.
+    virtual void willGather() {}
     virtual void open(); // base: nothing
+    // A pass has few contacts left to read; `close` follows unless it fails. Base: nothing.
+    virtual void willClose() {}
     // Removes the users of revoked locations from this conduit's prior state, and what was known of their access lists.
     // Subclasses persist their last-sync date.
     virtual void close();
@@ -117,6 +122,8 @@ protected:
 
 private:
     std::vector<RemoteLocation> locationsToRead(); // the owner's first; also tells the engine of the subscriptions
+    // `allIsNew`: every contact is going to be read, so that it can begin while the listing is under way.
+    std::optional<Dictionary> fetchWorkingState(const Url& base, bool* forbidden, bool allIsNew);
     void readLocation(const RemoteLocation& location, Dictionary& state);
     bool readGroup(const Url& base, const std::string& name, Dictionary& groupState);
     CXDChangeRecordPtr contactUpdate(const UserName& user, const RemoteLocation& base, const UniqueId& contact) const;

@@ -77,6 +77,18 @@ private:
     bool _expecting = false;
 };
 
+// The contacts of a part of a listing are going to be read.
+void expectContacts(CXFileManager& manager, const Url& base, const FileListing& part) {
+    std::vector<Url> contacts;
+    for (const auto& [path, file] : part) {
+        const std::string name = nameOf(path, file);
+        if (name.ends_with(kPersonSuffix) && layout::isASoundName(name) && file.modificationdate &&
+            file.size <= kLargestFile)
+            contacts.push_back(layout::contactLocation(base, UniqueId(name)));
+    }
+    manager.expectSomeReads(contacts, true); // payloads are read securely
+}
+
 Array arrayOf(const std::vector<UserName>& principals) {
     Array all;
     for (const UserName& principal : principals) all.append(principal);
@@ -116,7 +128,8 @@ void CXDConduit::readLocation(const RemoteLocation& location, Dictionary& state)
     const auto base = baseLocationForUser(realUserFromUser(user));
     if (!base) return;
     bool forbidden = true;
-    const auto userState = fetchWorkingStateForSubscription(*base, &forbidden);
+    const bool isNew = !_engine.conduitObjectForKey(*conduitID(), kPriorState).contains(user.str());
+    const auto userState = fetchWorkingState(*base, &forbidden, isNew && user != kSelf);
     if (forbidden) {
         const CXSubscriptionRef subscription = database().findSubscriptionWithRemoteLocation(location);
         _engine.revokeRemoteLocation(location, subscription ? std::optional(subscription->uniqueId()) : std::nullopt);
@@ -132,6 +145,10 @@ bool CXDConduit::isTrusted(const UserName& /*user*/, const Dictionary& /*state*/
 }
 
 std::optional<Dictionary> CXDConduit::fetchWorkingStateForSubscription(const Url& base, bool* forbidden) {
+    return fetchWorkingState(base, forbidden, false);
+}
+
+std::optional<Dictionary> CXDConduit::fetchWorkingState(const Url& base, bool* forbidden, bool allIsNew) {
     if (forbidden) *forbidden = false;
     CXFileManager* manager = defaultManager();
     if (!manager) return std::nullopt;
@@ -146,7 +163,11 @@ std::optional<Dictionary> CXDConduit::fetchWorkingStateForSubscription(const Url
     if (info)
         if (const Value serial = (*info)[kSerialNumber]) state.set(kSerialNumber, serial);
 
-    const auto listing = manager->infoForFilesInContainer(base);
+    // Without a serial number nothing is read of the tree.
+    const auto listing = allIsNew && state[kSerialNumber].isString()
+                             ? manager->infoForFilesInContainerByParts(
+                                   base, [&](const FileListing& part) { expectContacts(*manager, base, part); })
+                             : manager->infoForFilesInContainer(base);
     if (!listing) {
         CXLog("Could not retrieve info for files in subscription: %@", base);
         return std::nullopt;

@@ -8,6 +8,7 @@
 #include "conduits/UserAlert.h"
 #include "contacts/CXRolvane.h"
 #include "contacts/Constants.h"
+#include "foundation/CXException.h"
 #include "foundation/Log.h"
 #include "foundation/Preferences.h"
 #include "foundation/PropertyList.h"
@@ -15,6 +16,8 @@
 #include "model/RemoteLocationMap.h"
 #include "store/CXDAVManager.h"
 #include "store/CXNetworkController.h"
+
+#include <utility>
 
 namespace rolvane {
 namespace {
@@ -68,7 +71,10 @@ CXDVaultraConduit::CXDVaultraConduit(ConduitEngine& engine, World world)
                                                    [this](const Notification&) { networkChanged(); });
 }
 
-CXDVaultraConduit::~CXDVaultraConduit() = default;
+CXDVaultraConduit::~CXDVaultraConduit() {
+    awaitStructure();
+    if (_serverDate.valid()) _serverDate.wait();
+}
 
 std::optional<std::string> CXDVaultraConduit::conduitID() const {
     return kConduitVaultra;
@@ -100,19 +106,60 @@ std::optional<Url> CXDVaultraConduit::baseLocationOf(const CXDChangeRecord& reco
 
 // -- reachability and the pass's frame
 
-int CXDVaultraConduit::testReachability() {
+int CXDVaultraConduit::testReachability(const std::function<void()>& meanwhile) {
     CXDAVError error;
     const std::vector<std::string> origins = _world.manager.account().origins();
     const std::string address = origins.empty() ? "" : Url(origins.front() + "/").host();
     // Without a route nobody is asked, so nobody can refuse the password either.
-    const bool online = _world.network.canReachAddress(address) && _world.manager.canReach(error);
+    const bool online = _world.network.canReachAddress(address) && _world.manager.canReach(error, meanwhile);
     _vaultraOffLine = !online;
     CXDLog("Vaultra is %@", online ? "online" : "offline");
     return error.code;
 }
 
+// What a gathering asks first of a subscribed tree goes along with the test of the store and the login.
+void CXDVaultraConduit::beginReading() {
+    for (const CXSubscriptionRef& subscription : _world.rolvane.subscriptions()) {
+        const RemoteLocation location = subscription->remoteLocation();
+        if (syncSourceForRemoteLocation(location) != conduitSource()) continue;
+        const UserName user = engine().userForRemoteLocation(location);
+        const auto base = user.empty() || user == kSelf ? std::nullopt : baseLocationForUser(user);
+        if (!base) continue;
+        _world.manager.expectSomeReads({base->cxURLByAppendingComponent(layout::kInfo)}, false);
+        _world.manager.expectListing(*base);
+        return; // a wrong password is not to be offered many times
+    }
+}
+
+// A gathering reads a tree of which something is known, and finds it whole then.
+void CXDVaultraConduit::lookAfterStructure(bool meanwhile) {
+    awaitStructure();
+    if (!meanwhile) {
+        sanityCheckPublishStructure();
+        return;
+    }
+    const std::lock_guard guard(_structureLock);
+    _structure = std::async(std::launch::async, [this] {
+        try {
+            sanityCheckPublishStructure();
+        } catch (const CXException& exception) {
+            CXLog("The published tree could not be looked after: %@", exception);
+        }
+    });
+}
+
+void CXDVaultraConduit::awaitStructure() {
+    const std::lock_guard guard(_structureLock);
+    if (_structure.valid()) _structure.get();
+}
+
 void CXDVaultraConduit::open() {
-    if (testReachability() == kCXDAVErrorAuthentication) {
+    const bool gathering = std::exchange(_gathering, false);
+    if (_serverDate.valid()) _serverDate.wait(); // of a pass that failed
+    _serverDate = {};
+    _world.manager.expectNothing();
+    const int code = testReachability(gathering ? [this] { beginReading(); } : std::function<void()>());
+    if (code == kCXDAVErrorAuthentication) {
         if (shouldWarnUserAboutUserNameOrPassword()) {
             CXDLog("Username or password is incorrect. Displaying visual warning");
             warnUserAboutUserNameOrPassword();
@@ -126,15 +173,24 @@ void CXDVaultraConduit::open() {
     forgetSubscribersRights();
     const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
     _world.manager.keepSerialNumber(users[kSelf.str()].dictionary()[kSerialNumber].string());
-    sanityCheckPublishStructure();
+    lookAfterStructure(gathering && !users.contains(kSelf.str()));
+}
+
+void CXDVaultraConduit::willClose() {
+    const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
+    if (_vaultraOffLine || _serverDate.valid() || users.contains(kSelf.str()) || isToBePublishedAgain()) return;
+    _serverDate = std::async(std::launch::async, [this] { return currentServerDate(); });
 }
 
 void CXDVaultraConduit::close() {
     CXDConduit::close();
+    awaitStructure();
+    _world.manager.expectNothing();
     if (_vaultraOffLine) return;
     _world.manager.saveVersionMemory();
     if (isToBePublishedAgain()) return;
-    const std::optional<Date> now = currentServerDate();
+    std::optional<Date> now = _serverDate.valid() ? _serverDate.get() : std::nullopt;
+    if (!now) now = currentServerDate();
     CXDLog("Closing, last sync: %@", now);
     // A store that went away during the pass tells no date: keeping the old one costs reads, a guessed one loses edits.
     if (!now) return;
@@ -144,6 +200,7 @@ void CXDVaultraConduit::close() {
 }
 
 std::optional<Date> CXDVaultraConduit::currentServerDate() {
+    awaitStructure();
     const auto base = baseLocationForUser(realUserFromUser(kSelf));
     if (!base) return std::nullopt;
     const Url dateFile = layout::dateFileLocation(*base);
@@ -272,6 +329,7 @@ bool CXDVaultraConduit::isToBePublishedAgain() {
 // -- applying
 
 bool CXDVaultraConduit::lockStructureForRecord(const CXDChangeRecord& record) {
+    awaitStructure();
     const auto base = baseLocationOf(record);
     return base && engine().lockURL(layout::dateFileLocation(*base));
 }
@@ -429,6 +487,7 @@ bool CXDVaultraConduit::changeGroupReadWriteACL(CXDChangeRecord& record) {
 }
 
 bool CXDVaultraConduit::saveACLs() {
+    awaitStructure();
     const Dictionary unsaved = _world.preferences.get(kDaemonDomain, kUnsavedAccessListsKey).dictionary();
     if (!_vaultraOffLine)
         for (const auto& [location, changes] : unsaved) ACLManagerForRemoteLocation(Url(location));

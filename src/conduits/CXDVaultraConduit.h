@@ -5,6 +5,7 @@
 
 #include <atomic>
 #include <functional>
+#include <future>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -66,8 +67,13 @@ public:
     using CXDConduit::applyChangeRecord;
     bool applyChangeRecord(const CXDChangeRecordPtr& record, bool* denied) override;
     void wasRefused(const CXDChangeRecord& record) override;
-    // A refused user name or password warns the person, at most once in 15 minutes, and ends the daemon.
+    void willGather() override { _gathering = true; }
+    // A refused user name or password warns the person, at most once in 15 minutes, and ends the daemon. In a
+    // gathering the structure of a tree of which nothing is known is looked after while the pass goes on; what needs it
+    // waits.
     void open() override;
+    // Asks for the server's date in advance, where the owner publishes nothing that is locked and written meanwhile.
+    void willClose() override;
     // The stored last-sync date moves to the server's date; off line, or when the server does not tell it, it stays.
     void close() override;
     // The map's manager, else a new one for the location's base location, which the map then keeps. None when the
@@ -104,13 +110,17 @@ protected:
     bool isTrusted(const UserName& user, const Dictionary& state) override;
 
 private:
+    void beginReading();
+    void lookAfterStructure(bool meanwhile); // while the pass goes on
+    void awaitStructure();                   // any thread
     void publishAgain();
     void restoreAccessLists();
     bool isMended(const Dictionary& prior, const Dictionary& state);
     bool isToBePublishedAgain();
     void forgetSubscribersRights();
     void noteUnsavedAccessLists();
-    int testReachability(); // sets _vaultraOffLine; the error's code, 0 when there was none
+    // Sets _vaultraOffLine; the error's code, 0 when there was none. `meanwhile`: as of CXDAVManager::canReach.
+    int testReachability(const std::function<void()>& meanwhile = {});
     std::optional<Url> baseLocationOf(const CXDChangeRecord& record) const;
 
     bool mayBeNamed(const CXDChangeRecordPtr& record); // else it is refused for good
@@ -131,7 +141,11 @@ private:
     World _world;
     std::atomic<bool> _vaultraOffLine = false;
     CXDChangeRecords _leftovers; // of the gathering that is under way
+    bool _gathering = false;     // `open` belongs to a gathering
+    std::mutex _structureLock;
+    std::future<void> _structure; // the look at the own tree that is under way; guarded by _structureLock
     // The account is the manager's for good, and every record asks for its user's base location several times.
+    std::future<std::optional<Date>> _serverDate; // asked for in advance
     mutable std::mutex _basesLock;
     mutable std::unordered_map<UserName, Url> _bases; // guarded by _basesLock
     ObservationHandle _simulated, _networkChanged;

@@ -69,18 +69,25 @@ public:
         for (const CXDChangeRecordPtr& record : records) {
             if (!(record->appliesToSources() & CXDSyncSourceCX) || !record->delayedPayloadURL()) continue;
             if (!_manager) _manager = record->fileManager();
-            if (record->fileManager() == _manager) urls.push_back(*record->delayedPayloadURL());
+            if (record->fileManager() != _manager) continue;
+            urls.push_back(*record->delayedPayloadURL());
+            _positions.push_back(static_cast<size_t>(&record - records.data()));
         }
         if (_manager) _manager->expectReads(urls, true); // payloads are read securely
     }
     ~ReadingAhead() {
         if (_manager) _manager->expectReads({}, true);
     }
+    // The position of the record that has `count` such ones behind it; past the end where there are not so many.
+    size_t lastBut(size_t count) const {
+        return _positions.size() > count ? _positions[_positions.size() - 1 - count] : SIZE_MAX;
+    }
     ReadingAhead(const ReadingAhead&) = delete;
     ReadingAhead& operator=(const ReadingAhead&) = delete;
 
 private:
     CXFileManager* _manager = nullptr; // of the network store, the one that a pass reads
+    std::vector<size_t> _positions;    // of the records that read something
 };
 
 class NotingArrivals {
@@ -221,10 +228,12 @@ void ApplyLoop::applyOutOfOrder() {
 }
 
 void ApplyLoop::applyInOrder() {
+    constexpr size_t kFew = 50;
     const ReadingAhead ahead(_inOrder);
     const NotingArrivals noting(_parts, [this] { noteArrivals(); });
     for (; _inOrderDone < _inOrder.size(); ++_inOrderDone) {
         const CXDChangeRecordPtr& record = _inOrder[_inOrderDone];
+        if (_inOrderDone == ahead.lastBut(kFew) && !_parts.terminating) _parts.conduits.vaultra->willClose();
         applyInOrder(record);
         ++_processedCount;
         _parts.with.progress.didProcessChangeRecord(record);

@@ -194,8 +194,10 @@ CXDChangeRecords CXDSyncEngine::gather() {
     EngineConduits& conduits = _parts->conduits;
     CXDChangeRecords gathered;
     try {
+        conduits.vaultra->willGather();
         conduits.cx->open();
         conduits.vaultra->open();
+        forgetFormerSubscriptions(*_parts); // opening takes its time, and the scan must not meet their absence
         append(gathered, conduits.cx->changeRecords());
         if (_parts->with.releaseLocksOfEndedRuns && !_parts->vaultraOffLine()) _parts->with.releaseLocksOfEndedRuns();
         if (!_parts->vaultraOffLine()) append(gathered, conduits.vaultra->changeRecords());

@@ -11,7 +11,10 @@
 #include "store/CXNetworkController.h"
 #include "support/CapturingLog.h"
 
+#include <atomic>
+#include <chrono>
 #include <filesystem>
+#include <future>
 #include <gtest/gtest.h>
 #include <thread>
 
@@ -205,6 +208,67 @@ TEST_F(VaultraConduit, ClosingKeepsTheDateWhenTheStoreWentAwayDuringThePass) {
     client->wire->intercept([](const HttpRequest&) { return std::optional(answerOf(500)); });
     conduit->close();
     EXPECT_EQ(storedDate("CXDVaultraConduitLastSyncDate"), Date(1'700'000'000));
+}
+
+TEST_F(VaultraConduit, ADateThatWasAskedForInAdvanceIsNotAskedForAgain) {
+    open();
+    conduit->willClose();
+    conduit->willClose();
+    conduit->close();
+    EXPECT_EQ(client->wire->methods(), "PUT HEAD") << client->wire->text();
+    ASSERT_TRUE(conduit->lastSyncDate());
+    EXPECT_EQ(conduit->lastSyncDate(), client->manager.modDateForURL(client->at("dateFile")));
+
+    client->wire->clear();
+    conduit->close();
+    EXPECT_EQ(client->wire->methods(), "PUT HEAD") << "it is good for one pass";
+}
+
+TEST_F(VaultraConduit, ADateThatCouldNotBeHadInAdvanceIsAskedForWhenThePassCloses) {
+    open();
+    client->wire->intercept([](const HttpRequest&) { return std::optional(answerOf(500)); });
+    conduit->willClose();
+    while (client->wire->count("PROPFIND") == 0) std::this_thread::yield(); // the last that is tried
+    client->wire->intercept(nullptr);
+    conduit->close();
+    EXPECT_EQ(client->wire->methods(), "PUT HEAD PROPFIND PUT HEAD");
+    EXPECT_EQ(conduit->lastSyncDate(), client->manager.modDateForURL(client->at("dateFile")));
+}
+
+TEST_F(VaultraConduit, WhoeverPublishesAsksForNoDateInAdvance) {
+    engine.priorState(kConduitVaultra).dictionaryFor("<self>");
+    open();
+    conduit->willClose();
+    EXPECT_EQ(client->wire->text(), "");
+    conduit->close();
+    EXPECT_EQ(client->wire->methods(), "PUT HEAD");
+}
+
+TEST_F(VaultraConduit, AGatheringGoesOnWhileTheStructureIsMadeAndAChangeWaitsForIt) {
+    std::promise<void> opened;
+    const auto mayMake = opened.get_future().share();
+    std::atomic<bool> inTime{true};
+    client->wire->intercept([&, mayMake](const HttpRequest& request) -> std::optional<HttpResponse> {
+        if (request.method == "MKCOL" && mayMake.wait_for(std::chrono::seconds(10)) != std::future_status::ready)
+            inTime = false;
+        return std::nullopt;
+    });
+    conduit->willGather();
+    conduit->open();
+    EXPECT_FALSE(conduit->vaultraOffLine());
+    opened.set_value();
+    EXPECT_TRUE(apply(record(CXDUpdateRecord, "a:CXPerson", nullptr, Dictionary{{"First", "Ada"}})));
+    EXPECT_TRUE(inTime) << "opening has waited for the structure";
+    EXPECT_TRUE(std::filesystem::is_directory(world->file("People/31")));
+    EXPECT_EQ(client->wire->count("PUT"), 3u) << client->wire->text();
+}
+
+TEST_F(VaultraConduit, AGatheringFindsATreeThatIsKnownWhole) {
+    engine.priorState(kConduitVaultra).dictionaryFor("<self>");
+    conduit->willGather();
+    conduit->open();
+    EXPECT_TRUE(std::filesystem::is_directory(world->file("People/31")));
+    EXPECT_TRUE(std::filesystem::is_regular_file(world->file("info")));
 }
 
 TEST_F(VaultraConduit, ClosingForgetsRevokedUsers) {

@@ -3,6 +3,7 @@
 #include "Writes.h"
 #include "engine/EngineState.h"
 #include "foundation/CXException.h"
+#include "store/CXFileManager.h"
 #include "support/CapturingLog.h"
 
 #include <gtest/gtest.h>
@@ -51,6 +52,40 @@ TEST_F(Pass, AGatheringPassGoesFromTheStartedToTheStoppedNotification) {
     EXPECT_EQ(world.vaultra->applied(), Strings{"P1"});
     EXPECT_EQ(world.progress.will, 1);
     EXPECT_EQ(world.progress.did, 1);
+}
+
+TEST_F(Pass, TheStoreIsToldOnceWhenFewContactsAreLeftToReadAndNeverWhenThereWereNotMany) {
+    struct Files : CXFileManager {
+        std::optional<Dictionary> dictionaryAtURL(const Url&, int* code, bool) override {
+            if (code) *code = 200;
+            return Dictionary{{"First", "X"}};
+        }
+    } files;
+    const auto told = [&](int contacts) {
+        world.events.clear();
+        size_t applied = 0, before = 0;
+        world.cx->whenApplying = [&](const CXDChangeRecordPtr&, bool*) {
+            ++applied;
+            if (world.events.count("CXDVaultra will close") == 0) before = applied;
+            return true;
+        };
+        world.vaultra->whenGathering = [&] {
+            CXDChangeRecords all;
+            for (int i = 0; i < contacts; ++i) {
+                const std::string name = "P" + std::to_string(i) + ":CXSubscribedPerson";
+                all.push_back(makeRecord(CXDUpdateRecord, name.c_str(), nullptr,
+                                         {CXDSyncSourceVaultra, CXDSyncSourceCX, "bob"}, Dictionary()));
+                all.back()->setDelayedPayloadURL(Url("http://store.example/bob/Contacts/" + name), &files);
+            }
+            return all;
+        };
+        world.engine->bringSourcesUpToDate();
+        EXPECT_EQ(applied, static_cast<size_t>(contacts));
+        return std::pair(world.events.count("CXDVaultra will close"), before);
+    };
+    EXPECT_EQ(told(60), std::pair(size_t{1}, size_t{9}));
+    EXPECT_EQ(told(51), std::pair(size_t{1}, size_t{0}));
+    EXPECT_EQ(told(50).first, 0u);
 }
 
 TEST_F(Pass, ATricklePassOpensTheConduitsItselfAndStopsOnce) {

@@ -114,6 +114,7 @@ public:
         _events.add(_id + " open");
         if (whenOpening) whenOpening();
     }
+    void willClose() override { _events.add(_id + " will close"); }
     void close() override {
         _events.add(_id + " close");
         CXDConduit::close();

@@ -92,9 +92,25 @@ TEST_F(Resubscribing, ToWhatCouldNeverBeReadIsNoRevokedSubscription) {
 TEST_F(Resubscribing, DuringAPassTakesNothingFromThePublisher) {
     std::atomic<bool> once = true;
     bob.wire->intercept([&](const HttpRequest& request) -> std::optional<HttpResponse> {
-        if (request.method == "PROPFIND" && request.url.encodedPath().find("/alice/") != std::string::npos &&
-            once.exchange(false))
+        // of a group or its access list: asked when the own changes have been gathered already
+        if (request.method == "PROPFIND" && request.url.path().find("CXGroup") != std::string::npos &&
+            request.url.path().find("/alice/") != std::string::npos && once.exchange(false))
             subscribeAnew();
+        return std::nullopt;
+    });
+    bob.pass();
+    ASSERT_FALSE(once);
+    bob.wire->clear();
+    bob.pass();
+    bob.database->deliverExternalChanges();
+    bob.pass();
+    expectEverythingHereAgainAndNothingWritten();
+}
+
+TEST_F(Resubscribing, WhileAPassOpensTakesNothingFromThePublisher) {
+    std::atomic<bool> once = true;
+    bob.wire->intercept([&](const HttpRequest& request) -> std::optional<HttpResponse> {
+        if (request.method == "OPTIONS" && once.exchange(false)) subscribeAnew();
         return std::nullopt;
     });
     bob.pass();

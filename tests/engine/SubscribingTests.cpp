@@ -2,9 +2,15 @@
 
 #include "support/CapturingLog.h"
 
+#include <algorithm>
+#include <atomic>
+#include <chrono>
 #include <filesystem>
 #include <fstream>
+#include <future>
 #include <gtest/gtest.h>
+#include <mutex>
+#include <set>
 
 namespace rolvane::test {
 namespace {
@@ -64,6 +70,80 @@ TEST_F(Subscribing, TheFirstPassBringsEverybodyFieldByFieldWithTheirGroups) {
     EXPECT_EQ(copies().size(), 4u) << log.text();
     EXPECT_EQ(bob.countPeople(), 0u) << "they are copies, not Bob's own";
     EXPECT_TRUE(bob.engine->getPendingChanges().empty());
+}
+
+// Requests are noted when they are begun; each has its place only once.
+TEST_F(Subscribing, TheFirstPassAsksForEverythingOnceAndForContactsBeforeItHasReadTheGroups) {
+    std::mutex lock;
+    std::vector<std::string> begun;
+    answerBob([&](const HttpRequest& request) {
+        const std::lock_guard guard(lock);
+        if (request.url.path().find("/alice/") != std::string::npos)
+            begun.push_back(request.method + " " + request.url.path());
+        return std::nullopt;
+    });
+    bob.pass();
+    answerBob(nullptr);
+    EXPECT_EQ(copies(), alice.view());
+    std::set<std::string> once(begun.begin(), begun.end());
+    EXPECT_EQ(once.size(), begun.size()) << bob.wire->text();
+    const auto first = [&](std::string_view what) {
+        return std::find_if(begun.begin(), begun.end(),
+                            [&](const std::string& each) {
+                                return each.starts_with("GET ") && each.find(what) != std::string::npos;
+                            }) -
+               begun.begin();
+    };
+    EXPECT_EQ(bob.reads("CXPerson"), people.size());
+    EXPECT_LT(first("CXPerson"), first("CXGroup")) << bob.wire->text();
+    EXPECT_LT(first("/info"), first("CXPerson")) << bob.wire->text();
+}
+
+TEST_F(Subscribing, TheFirstPassReadsWhileItsOwnTreeIsMade) {
+    std::promise<void> reading;
+    const auto mayMake = reading.get_future().share();
+    std::atomic<bool> inTime{true}, told{false};
+    answerBob([&, mayMake](const HttpRequest& request) -> std::optional<HttpResponse> {
+        if (request.method == "MKCOL" && mayMake.wait_for(std::chrono::seconds(10)) != std::future_status::ready)
+            inTime = false;
+        if (request.method == "GET" && request.url.path().ends_with("CXPerson") && !told.exchange(true))
+            reading.set_value();
+        return std::nullopt;
+    });
+    bob.pass();
+    answerBob(nullptr);
+    EXPECT_TRUE(inTime) << "no contact was read before the tree was made";
+    EXPECT_EQ(copies(), alice.view());
+    EXPECT_TRUE(std::filesystem::is_directory(world->file("People/31", "bob")));
+    EXPECT_TRUE(std::filesystem::is_regular_file(world->file("info", "bob")));
+}
+
+TEST_F(Subscribing, NothingComesByAFirstListingThatFailedAndAllByTheNextOne) {
+    const std::string bucket = "/People/" + CXACLManager::bucketNameForUID(people[1]->uniqueId()) + "/";
+    answerBob([&](const HttpRequest& request) {
+        return request.method == "PROPFIND" && request.url.path().ends_with(bucket) ? std::optional(answerOf(500))
+                                                                                    : std::nullopt;
+    });
+    bob.pass();
+    EXPECT_TRUE(copies().empty());
+    answerBob(nullptr);
+    people[0]->setValue(Value("Adelheid"), kCXFirstNameProperty); // read early, and in vain
+    alice.application->save();
+    alice.pass();
+    bob.pass();
+    EXPECT_EQ(copies(), alice.view());
+}
+
+TEST_F(Subscribing, AStoreThatForbidsTheInformationGivesNoContactsHoweverMuchWasBegun) {
+    std::atomic<int> contacts{0};
+    answerBob([&](const HttpRequest& request) -> std::optional<HttpResponse> {
+        contacts += request.url.path().ends_with("CXPerson");
+        if (request.method == "GET" && request.url.path().ends_with("/alice/Contacts/info")) return answerOf(403);
+        return std::nullopt;
+    });
+    EXPECT_THROW(bob.pass(), Ended) << "nothing is left to do";
+    EXPECT_TRUE(copies().empty());
+    EXPECT_EQ(contacts, 0);
 }
 
 TEST_F(Subscribing, ASecondPassWritesNothingAndReadsNoMoreThanTheListing) {
