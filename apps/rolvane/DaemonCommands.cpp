@@ -119,7 +119,7 @@ Json status(Context& context) {
             {"daemon", pid ? Json(*pid) : Json()},
             {"store", storeStatus()},
             {"published", {{"everything", publication.everything()}, {"groups", groups}}},
-            {"leftOnStore", anythingLeftOnStore(preferences)},
+            {"leftOnStore", anythingLeftOnStore(database, preferences)},
             {"subscriptions", subscriptions},
             {"withdrawn", withdrawnJson()},
             {"refused", refusedJson(preferences)},

@@ -8,6 +8,7 @@
 #include "store/CXDAVManager.h"
 #include "store/CXWebDAVLock.h"
 
+#include <algorithm>
 #include <fmt/format.h>
 #include <set>
 
@@ -138,8 +139,12 @@ std::optional<LeftOnStore::Failure> LeftOnStore::removeGroup(const UniqueId& gro
     return std::nullopt;
 }
 
-bool anythingLeftOnStore(const Preferences& preferences) {
-    return !preferences.get(kDaemonDomain, kLeftOnStore).dictionary().empty();
+bool anythingLeftOnStore(CXRolvane& database, Preferences& preferences) {
+    const Dictionary all = preferences.get(kDaemonDomain, kLeftOnStore).dictionary();
+    const auto bases = all.allKeys();
+    return std::any_of(bases.begin(), bases.end(), [&](const std::string& base) {
+        return LeftOnStore(database, preferences, Url(base)).anything();
+    });
 }
 
 } // namespace rolvane::cli

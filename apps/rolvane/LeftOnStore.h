@@ -48,7 +48,7 @@ private:
     Url _base;
 };
 
-// Is anything noted, for whatever location?
-bool anythingLeftOnStore(const Preferences& preferences);
+// Is anything left, at whatever location?
+bool anythingLeftOnStore(CXRolvane& database, Preferences& preferences);
 
 } // namespace rolvane::cli

@@ -1,5 +1,7 @@
 #include "CommandWorld.h"
 
+#include "foundation/Preferences.h"
+
 #include <filesystem>
 #include <fstream>
 
@@ -34,6 +36,13 @@ protected:
         world.group("Work", {"Bob", "Cid"});
         world.done({"publish", "--group", "Family"});
         world.done({"publish", "--group", "Work"});
+    }
+    // As a command leaves it that was killed before the end.
+    void noteTheTree() {
+        Preferences preferences(world.home / "state/rolvane/preferences.db");
+        const std::string location = world.json({"status"})["store"]["location"];
+        preferences.set(kDaemonDomain, "CXDLeftOnStore", Dictionary{{location, Dictionary{{"tree", true}}}});
+        preferences.synchronize(kDaemonDomain);
     }
     const Names family{"AllCXGroup", "Family", "People/Ada", "People/Bob", "dateFile", "info"};
     std::map<std::string, std::string> uids;
@@ -129,6 +138,30 @@ TEST_F(Withdrawing, ThatFailedAndIsRepeatedWithKeepLeavesTheFiles) {
     storeWorksAgain();
     world.done({"unpublish", "--keep"});
     EXPECT_TRUE(world.namedTree().contains("People/Ada"));
+    EXPECT_FALSE(anythingLeft());
+}
+
+TEST_F(Withdrawing, ThatWasKilledBeforeItTookAnythingAwayIsFinished) {
+    world.done({"publish"});
+    world.done({"unpublish", "--keep"});
+    noteTheTree();
+    EXPECT_TRUE(anythingLeft());
+    world.done({"delete", "--yes", "Ada"});
+    world.done({"publish"});
+    EXPECT_EQ(world.namedTree(), (Names{"AllCXGroup", "People/Bob", "People/Cid", "dateFile", "info"}));
+    EXPECT_FALSE(anythingLeft());
+}
+
+TEST_F(Withdrawing, ThatWasKilledBeforeItWasSavedTakesNothingOffTheStore) {
+    world.done({"publish"});
+    const std::string before = contentsOf(world.published("info"));
+    noteTheTree();
+    EXPECT_FALSE(anythingLeft());
+    world.done({"publish"});
+    EXPECT_EQ(contentsOf(world.published("info")), before) << "it is the same tree";
+    EXPECT_TRUE(world.namedTree().contains("People/Ada"));
+    world.done({"unpublish"});
+    EXPECT_EQ(world.tree(), Names{});
     EXPECT_FALSE(anythingLeft());
 }
 
