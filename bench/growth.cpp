@@ -242,7 +242,7 @@ void measure(const std::string& cards, const std::string& directory, int repetit
         "mingling", [&] { mingled.clear(); },
         [&] {
             Mingler mingler;
-            for (const CXDChangeRecordPtr& record : captured) mingler.mingle(record);
+            mingler.mingle(captured);
             mingled = mingler.takeMingled();
         });
     captured.clear();

@@ -37,7 +37,7 @@ void append(CXDChangeRecords& to, CXDChangeRecords&& from) {
 
 CXDChangeRecords mingled(const CXDChangeRecords& input) {
     Mingler mingler;
-    for (const CXDChangeRecordPtr& record : input) mingler.mingle(record);
+    mingler.mingle(input);
     return mingler.takeMingled();
 }
 

@@ -45,13 +45,13 @@ bool areOwnersBoth(const CXDChangeRecord& a, const CXDChangeRecord& b) {
 }
 
 bool personsContradict(const CXDChangeRecord& a, const CXDChangeRecord& b) {
-    return present(a.person(), b.person()) && isRemoval(a) != isRemoval(b) &&
+    return isRemoval(a) != isRemoval(b) && present(a.person(), b.person()) &&
            (!areOwnersBoth(a, b) || a.group() == b.group() || takesPersonOut(a) || takesPersonOut(b));
 }
 
 bool groupsContradict(const CXDChangeRecord& a, const CXDChangeRecord& b) {
-    return present(a.group(), b.group()) && a.type() != CXDUpdateDistributionList &&
-           b.type() != CXDUpdateDistributionList && isRemoval(a) != isRemoval(b) &&
+    return isRemoval(a) != isRemoval(b) && a.type() != CXDUpdateDistributionList &&
+           b.type() != CXDUpdateDistributionList && present(a.group(), b.group()) &&
            (!areOwnersBoth(a, b) || takesGroupOut(a) || takesGroupOut(b));
 }
 
@@ -92,6 +92,7 @@ constexpr uint32_t kNone = NumberTable::kNone;
 class Mingler::List {
 public:
     uint32_t next() const { return static_cast<uint32_t>(_records.size()); }
+    void expect(size_t more) { _records.reserve(_records.size() + more); }
     const CXDChangeRecordPtr& operator[](uint32_t number) const { return _records[number]; }
     void append(const CXDChangeRecordPtr& record) {
         if (_indexed) _equal.emplace(record, next());
@@ -129,13 +130,17 @@ private:
 // The elements of all buckets. Those of one bucket are chained from the latest to the earliest.
 class Mingler::Elements {
 public:
+    // The record lies far away in memory; with its hash and kind at hand, few elements need a look at it.
     struct Element {
         uint32_t record; // its number in the list; kNone after the removal
         uint32_t previous;
+        uint32_t hash;
+        bool isRemoval;
     };
     Element& operator[](uint32_t element) { return _elements[element]; }
-    uint32_t add(uint32_t record, uint32_t previous) {
-        _elements.push_back({record, previous});
+    void expect(size_t more) { _elements.reserve(_elements.size() + more); }
+    uint32_t add(const Element& element) {
+        _elements.push_back(element);
         return static_cast<uint32_t>(_elements.size() - 1);
     }
 
@@ -149,16 +154,15 @@ public:
     Index(const List& list, Elements& elements) : _list(list), _elements(elements) {}
 
     void add(uint32_t element) {
-        const CXDChangeRecord& record = recordOf(element);
-        _equal.add(hashOf(record), element);
+        _equal.add(_elements[element].hash, element);
         _all.push_back(element);
-        ++(isRemoval(record) ? _removals : _others);
+        ++(_elements[element].isRemoval ? _removals : _others);
         if (_byIdentifierBuilt) addByIdentifier(element);
     }
     void remove(uint32_t element) { _elements[element].record = kNone; }
 
-    uint32_t findEqual(const CXDChangeRecord& record) const {
-        return _equal.find(hashOf(record), [&](uint32_t element) {
+    uint32_t findEqual(const CXDChangeRecord& record, uint32_t hash) const {
+        return _equal.find(hash, [&](uint32_t element) {
             return _elements[element].record != kNone && recordOf(element).isEqual(record);
         });
     }
@@ -197,7 +201,6 @@ private:
     using ByIdentifier = std::unordered_map<UniqueId, std::array<Candidates, 2>>; // [is a removal]
 
     const CXDChangeRecord& recordOf(uint32_t element) const { return *_list[_elements[element].record]; }
-    static uint32_t hashOf(const CXDChangeRecord& record) { return folded(RecordHash()(record)); }
 
     void collect(std::vector<uint32_t>& elements, uint32_t stop, bool all, std::vector<uint32_t>& found) {
         while (!elements.empty() && _elements[elements.back()].record == kNone) elements.pop_back();
@@ -234,9 +237,9 @@ private:
 };
 
 struct Mingler::Bucket {
-    UniqueId identifier;
-    uint32_t last = kNone; // element
-    uint32_t count = 0;    // removed ones included
+    const UniqueId* identifier; // of its first record: an empty bucket accepts anything, so the list holds that one
+    uint32_t last = kNone;      // element
+    uint32_t count = 0;         // removed ones included
     std::unique_ptr<Index> index;
 };
 
@@ -245,20 +248,26 @@ public:
     explicit Buckets(size_t indexFrom) : _indexFrom(indexFrom) {}
 
     // mingleChangeRecord:from:withBucket: of the identifier's bucket.
-    bool mingle(const UniqueId& identifier, const CXDChangeRecordPtr& record) {
+    bool mingle(const UniqueId& identifier, const CXDChangeRecord& record, uint32_t hash) {
         Bucket& bucket = bucketOf(identifier);
         if (!bucket.index && bucket.count >= _indexFrom) buildIndex(bucket);
-        const bool accepted = bucket.index ? passesIndex(*bucket.index, record) : passesWalk(bucket, record);
+        const bool accepted =
+            bucket.index ? passesIndex(*bucket.index, record, hash) : passesWalk(bucket, record, hash);
         if (accepted) _justAccepted.push_back(&bucket);
         return accepted;
     }
+    void expect(size_t records) {
+        list.expect(records);
+        _elements.expect(2 * records); // a person's and a group's
+    }
+    void prefetchSlotOf(const UniqueId& identifier) const { _byIdentifier.prefetch(identifier.text().hash()); }
     // To be called when the record has passed its buckets.
-    bool appendIfAccepted(const CXDChangeRecordPtr& record) {
+    bool appendIfAccepted(const CXDChangeRecordPtr& record, uint32_t hash) {
         if (_justAccepted.empty()) return false;
         const uint32_t number = list.next();
         list.append(record);
         for (Bucket* bucket : _justAccepted) {
-            bucket->last = _elements.add(number, bucket->last);
+            bucket->last = _elements.add({number, bucket->last, hash, isRemoval(*record)});
             ++bucket->count;
             if (bucket->index) bucket->index->add(bucket->last);
         }
@@ -270,42 +279,40 @@ public:
 
 private:
     Bucket& bucketOf(const UniqueId& identifier) {
-        // What concerns one person mostly comes in a row.
-        if (!_buckets.empty() && _buckets[_latest].identifier == identifier) return _buckets[_latest];
         const uint32_t hash = identifier.text().hash();
         const uint32_t known =
-            _byIdentifier.find(hash, [&](uint32_t number) { return _buckets[number].identifier == identifier; });
-        if (known != kNone) return _buckets[_latest = known];
-        _latest = static_cast<uint32_t>(_buckets.size());
-        _byIdentifier.add(hash, _latest);
-        _buckets.push_back({identifier, kNone, 0, nullptr});
+            _byIdentifier.find(hash, [&](uint32_t number) { return *_buckets[number].identifier == identifier; });
+        if (known != kNone) return _buckets[known];
+        _byIdentifier.add(hash, static_cast<uint32_t>(_buckets.size()));
+        _buckets.push_back({&identifier, kNone, 0, nullptr});
         return _buckets.back();
     }
 
-    bool passesWalk(Bucket& bucket, const CXDChangeRecordPtr& record) {
+    bool passesWalk(Bucket& bucket, const CXDChangeRecord& record, uint32_t hash) {
         uint32_t* link = &bucket.last;
         while (*link != kNone) {
-            const CXDChangeRecordPtr& element = list[_elements[*link].record];
-            if (element->isEqual(*record)) return false;
-            const Outcome outcome = settle(*record, *element);
+            Elements::Element& element = _elements[*link];
+            const bool mayContradict = element.isRemoval != isRemoval(record);
+            if (!mayContradict && element.hash == hash && list[element.record]->isEqual(record)) return false;
+            const Outcome outcome = mayContradict ? settle(record, *list[element.record]) : Outcome::nothing;
             if (outcome == Outcome::recordLoses) return false;
             if (outcome == Outcome::elementLoses) {
-                list.removeEqual(element);
-                *link = _elements[*link].previous;
+                list.removeEqual(list[element.record]);
+                *link = element.previous;
                 --bucket.count;
             } else {
-                link = &_elements[*link].previous;
+                link = &element.previous;
             }
         }
         return true;
     }
 
     // The same over the index: only elements behind the equal one (if there is one) are ever reached.
-    bool passesIndex(Index& index, const CXDChangeRecordPtr& record) {
-        const uint32_t stop = index.findEqual(*record);
-        for (const uint32_t candidate : index.candidates(*record, stop)) {
+    bool passesIndex(Index& index, const CXDChangeRecord& record, uint32_t hash) {
+        const uint32_t stop = index.findEqual(record, hash);
+        for (const uint32_t candidate : index.candidates(record, stop)) {
             const CXDChangeRecordPtr& element = list[_elements[candidate].record];
-            const Outcome outcome = settle(*record, *element);
+            const Outcome outcome = settle(record, *element);
             if (outcome == Outcome::recordLoses) return false;
             if (outcome == Outcome::elementLoses) {
                 list.removeEqual(element);
@@ -326,7 +333,6 @@ private:
     Elements _elements;
     NumberTable _byIdentifier;
     std::deque<Bucket> _buckets; // stay where they are
-    uint32_t _latest = 0;        // the bucket that was asked for last
     std::vector<Bucket*> _justAccepted;
 };
 
@@ -334,11 +340,28 @@ Mingler::Mingler(size_t indexFrom) : _buckets(std::make_unique<Buckets>(indexFro
 Mingler::~Mingler() = default;
 
 bool Mingler::mingle(const CXDChangeRecordPtr& record) {
-    const bool accepted = record->person() && _buckets->mingle(*record->person(), record);
+    const uint32_t hash = folded(RecordHash()(*record));
+    const bool accepted = record->person() && _buckets->mingle(*record->person(), *record, hash);
     // In a bucket that has just accepted it, it would meet itself.
     if (record->group() && !(accepted && record->group() == record->person()))
-        _buckets->mingle(*record->group(), record);
-    return _buckets->appendIfAccepted(record);
+        _buckets->mingle(*record->group(), *record, hash);
+    return _buckets->appendIfAccepted(record, hash);
+}
+
+// Persons come in an order of their own: a record, its identifier and the identifier's slot in the table each lie far
+// away in memory from the ones before.
+void Mingler::mingle(const CXDChangeRecords& records) {
+    constexpr size_t kSlotAhead = 6, kIdentifierAhead = 12, kRecordAhead = 24;
+    const auto personAt = [&](size_t i) -> const UniqueId* {
+        return i < records.size() && records[i]->person() ? &*records[i]->person() : nullptr;
+    };
+    _buckets->expect(records.size());
+    for (size_t i = 0; i < records.size(); ++i) {
+        if (i + kRecordAhead < records.size()) __builtin_prefetch(records[i + kRecordAhead].get());
+        if (const UniqueId* person = personAt(i + kIdentifierAhead)) person->text().prefetch();
+        if (const UniqueId* person = personAt(i + kSlotAhead)) _buckets->prefetchSlotOf(*person);
+        mingle(records[i]);
+    }
 }
 
 CXDChangeRecords Mingler::takeMingled() {

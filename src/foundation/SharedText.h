@@ -37,6 +37,8 @@ public:
         if (known == 0) _node->hash.store(known = hashOf(_node->text), std::memory_order_relaxed);
         return known;
     }
+    // Asks the processor to bring near what hash() and the first look at the text need.
+    void prefetch() const noexcept { __builtin_prefetch(_node); }
     static uint32_t hashOf(std::string_view text) noexcept { // never 0
         const uint64_t wide = std::hash<std::string_view>{}(text);
         const auto folded = static_cast<uint32_t>(wide ^ (wide >> 32));

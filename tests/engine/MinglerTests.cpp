@@ -107,6 +107,9 @@ RC_GTEST_PROP(Mingling, GivesWhatTheLiteralWalkGivesWithTheSameLog, ()) {
     RC_ASSERT(quiet.accepted == expected.accepted);
     RC_ASSERT(quiet.mingled == expected.mingled);
     RC_ASSERT(quiet.log.empty());
+    Mingler atOnce(indexFrom);
+    atOnce.mingle(records);
+    RC_ASSERT(test::identities(atOnce.takeMingled()) == expected.mingled);
 }
 
 TEST(Mingling, TheSameRecordNewAndCarriedOverEndsUpOnce) {
