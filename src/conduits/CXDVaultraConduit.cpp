@@ -259,6 +259,8 @@ bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state)
     prior.remove(kLookAgain);
     if (condition.isSound()) {
         prior.set(kTreeDates, state[kTreeDates].dictionary());
+        _read.emplace(user, state);
+        if (isOwn && somebodyMayWrite()) _leftovers = removalOfUnlisted(prior, state);
         return true;
     }
     CXLog("The tree of %@ %@. %@", isOwn ? *realUserFromUser(user) : user, condition.sentence,
@@ -280,17 +282,41 @@ bool CXDVaultraConduit::isMended(const Dictionary& prior, const Dictionary& stat
     if (again.empty()) return true;
     if (isToBePublishedAgain()) return false;
     engine().setConduitObjectForKey(kConduitCX, Dictionary(), kPublishAgain);
-    const auto writers = _world.rolvane.allGroup()->multiValueForProperty(kCXReadWriteSharingACLProperty);
-    if (writers && !writers->empty()) return true;
+    if (somebodyMayWrite()) return true;
     _leftovers = removalOfLeftovers(prior, state);
     return _leftovers.empty();
 }
 
+bool CXDVaultraConduit::somebodyMayWrite() {
+    const auto writers = _world.rolvane.allGroup()->multiValueForProperty(kCXReadWriteSharingACLProperty);
+    return writers && !writers->empty();
+}
+
 CXDChangeRecords CXDVaultraConduit::changeRecords() {
     CXDChangeRecords records = CXDConduit::changeRecords();
+    leaveUnlistedOut(records);
+    _read.clear();
     records.insert(records.end(), _leftovers.begin(), _leftovers.end());
     _leftovers.clear();
     return records;
+}
+
+// A contact that no list names is about to be added, and comes when it is listed; or it has been deleted and was
+// written once more by somebody who did not know. Whoever knows it reads what is written. Nobody else takes it in: it
+// would stay behind when its file goes. From the own tree it is taken away.
+void CXDVaultraConduit::leaveUnlistedOut(CXDChangeRecords& records) {
+    std::map<UserName, ListOfEverybody> lists;
+    std::erase_if(records, [&](const CXDChangeRecordPtr& record) {
+        if (record->type() != CXDUpdateRecord || !record->person() || !record->user()) return false;
+        const auto read = _read.find(*record->user());
+        if (read == _read.end()) return false;
+        const UniqueId shared = cxNormalizedUID(*record->person());
+        if (lists.try_emplace(*record->user(), read->second).first->second.names(shared)) return false;
+        if (_world.rolvane.recordForUniqueId(*record->person())) return false;
+        CXDLog("Not listed, and left out: %@", record);
+        if (record->user() == kSelf && somebodyMayWrite()) _leftovers.push_back(removalOfContact(shared));
+        return true;
+    });
 }
 
 // The next scan takes everything for new.
@@ -412,16 +438,17 @@ bool CXDVaultraConduit::makeCompositeGroupChange(CXDChangeRecord& record, int& c
     return done;
 }
 
-// A group of another user's that is known and whose state is gone, asked twice: it has been deleted there, and a part
-// of it would bring it back without its name and members. The change is given up.
+// A group that is known and whose state is gone, asked twice: somebody else who may write has deleted it, and a part of
+// it would bring it back without its name and members. The change is given up. Where the store has lost the state of an
+// own group, the next look at the tree finds that out, and all of it is published again.
 bool CXDVaultraConduit::wasDeletedThere(CXDChangeRecord& record) {
-    if (record.changeMadeByDataOwner() || !record.user() || !record.group()) return false;
+    if (!record.user() || !record.group()) return false;
     const Dictionary known = engine().knownGroupState(kConduitVaultra, *record.user(), *record.group());
     if (known.empty()) return false;
     int code = 0;
     const Url location = layout::groupLocation(*baseLocationOf(record), *record.group());
     if (_world.manager.dictionaryAtURL(location, false, &code) || code != kMissing) return false;
-    CXLog("The group has been deleted by its publisher, and is not changed any more: %@", record.description());
+    CXLog("The group has been deleted by somebody else, and is not changed any more: %@", record.description());
     engine().noteRefused({*record.user(), kRefusedAsGroupIsGone, known[kCXGroupNameProperty].string()});
     return true;
 }

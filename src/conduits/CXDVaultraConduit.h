@@ -6,6 +6,7 @@
 #include <atomic>
 #include <functional>
 #include <future>
+#include <map>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -117,6 +118,8 @@ private:
     void restoreAccessLists();
     bool isMended(const Dictionary& prior, const Dictionary& state);
     bool isToBePublishedAgain();
+    bool somebodyMayWrite(); // besides the owner
+    void leaveUnlistedOut(CXDChangeRecords& records);
     void forgetSubscribersRights();
     void noteUnsavedAccessLists();
     // Sets _vaultraOffLine; the error's code, 0 when there was none. `meanwhile`: as of CXDAVManager::canReach.
@@ -140,8 +143,9 @@ private:
 
     World _world;
     std::atomic<bool> _vaultraOffLine = false;
-    CXDChangeRecords _leftovers; // of the gathering that is under way
-    bool _gathering = false;     // `open` belongs to a gathering
+    CXDChangeRecords _leftovers;          // of the gathering that is under way
+    std::map<UserName, Dictionary> _read; // so far: the states of known users
+    bool _gathering = false;              // `open` belongs to a gathering
     std::mutex _structureLock;
     std::future<void> _structure; // the look at the own tree that is under way; guarded by _structureLock
     // The account is the manager's for good, and every record asks for its user's base location several times.

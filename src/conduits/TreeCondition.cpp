@@ -52,6 +52,14 @@ bool isSetBack(const Dictionary& prior, const Dictionary& current, const std::op
     return made && madeBefore && *made != *madeBefore;
 }
 
+CXDChangeRecordPtr ownersChange(CXDChangeType type, std::optional<UniqueId> person, std::optional<UniqueId> group,
+                                const Value& payload = {}) {
+    auto record =
+        std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, type, kSelf, std::move(person), std::move(group), payload);
+    record->setAppliesToSources(CXDSyncSourceVaultra);
+    return record;
+}
+
 } // namespace
 
 TreeCondition treeCondition(const Dictionary& prior, const Dictionary& current, std::optional<Date> lastVisit) {
@@ -76,9 +84,7 @@ CXDChangeRecords removalOfLeftovers(const Dictionary& prior, const Dictionary& c
     CXDChangeRecords removals;
     const auto remove = [&](CXDChangeType type, std::optional<UniqueId> person, std::optional<UniqueId> group,
                             const Value& payload = {}) {
-        auto record = std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, type, kSelf, person, group, payload);
-        record->setAppliesToSources(CXDSyncSourceVaultra);
-        removals.push_back(std::move(record));
+        removals.push_back(ownersChange(type, person, group, payload));
     };
     for (const auto& [name, state] : current) {
         if (!isGroup(name)) continue;
@@ -95,8 +101,37 @@ CXDChangeRecords removalOfLeftovers(const Dictionary& prior, const Dictionary& c
     std::unordered_set<std::string> people;
     for (const Value& person : prior[kEverybody].dictionary()[kMemberUIDState].array()) people.insert(person.string());
     for (const auto& [person, info] : current[kPeopleState].dictionary()[kMemberUIDState].dictionary())
-        if (!people.contains(person)) remove(CXDDeleteRecord, UniqueId(person), std::nullopt);
+        if (!people.contains(person)) removals.push_back(removalOfContact(UniqueId(person)));
     return removals;
+}
+
+CXDChangeRecords removalOfUnlisted(const Dictionary& prior, const Dictionary& current) {
+    CXDChangeRecords removals;
+    const Value &before = prior[kEverybody], &now = current[kEverybody];
+    if (!now.dictionary().contains(kMemberUIDState) || before == now) return removals;
+    const Dictionary difference = groupDifference(before, now);
+    const Dictionary people = current[kPeopleState].dictionary()[kMemberUIDState].dictionary();
+    for (const Value& person : difference[kMemberRemoves].array())
+        if (people.contains(person.string())) removals.push_back(removalOfContact(UniqueId(person.string())));
+    for (const Value& group : difference[kSubgroupRemoves].array())
+        if (!current[group.string()].dictionary().empty())
+            removals.push_back(ownersChange(CXDDeleteGroup, std::nullopt, UniqueId(group.string())));
+    return removals;
+}
+
+CXDChangeRecordPtr removalOfContact(const UniqueId& person) {
+    return ownersChange(CXDDeleteRecord, person, std::nullopt);
+}
+
+ListOfEverybody::ListOfEverybody(const Dictionary& current)
+    : _members(current[kEverybody].dictionary()[kMemberUIDState].array()) {
+    _names.reserve(_members.count());
+    for (const Value& member : _members)
+        if (const std::string* name = member.stringIf()) _names.insert(*name);
+}
+
+bool ListOfEverybody::names(const UniqueId& person) const {
+    return _names.contains(person.str());
 }
 
 } // namespace rolvane

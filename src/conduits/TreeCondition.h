@@ -6,6 +6,8 @@
 
 #include <optional>
 #include <string>
+#include <string_view>
+#include <unordered_set>
 
 // Whether a published tree still is what it was: a store that is restored from an older copy, or that loses files, says
 // the same as somebody who took contacts away. Pure functions over per-user states (see StoreComparison.h), with
@@ -42,5 +44,23 @@ Dictionary datesToWaitFor(const Dictionary& current);
 
 // The changes of the owner's that take off the store whatever `prior` does not know: members, groups and contacts.
 CXDChangeRecords removalOfLeftovers(const Dictionary& prior, const Dictionary& current);
+
+// The changes of the owner's that take off the store what the list of everybody named in `prior`, does not name any
+// longer, and still lies there: another writer has taken it out, and a change that was under way brought its file back.
+CXDChangeRecords removalOfUnlisted(const Dictionary& prior, const Dictionary& current);
+
+// The same of one contact.
+CXDChangeRecordPtr removalOfContact(const UniqueId& person);
+
+// The list of everybody of a tree, to be asked for many.
+class ListOfEverybody {
+public:
+    explicit ListOfEverybody(const Dictionary& current);
+    bool names(const UniqueId& person) const;
+
+private:
+    Array _members;
+    std::unordered_set<std::string_view> _names;
+};
 
 } // namespace rolvane

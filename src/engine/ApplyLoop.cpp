@@ -10,6 +10,7 @@
 #include "engine/Mingler.h"
 #include "engine/OutOfOrderWork.h"
 #include "engine/PublicationCache.h"
+#include "engine/TakenOut.h"
 #include "engine/UnderWay.h"
 #include "engine/UnsettledGroups.h"
 #include "foundation/CXException.h"
@@ -176,6 +177,7 @@ CXDChangeRecords ApplyLoop::accepted() {
     CXDChangeRecords swallowed, others;
     for (const CXDChangeRecordPtr& record : _unhandled)
         (_parts.conduits.cx->swallows(*record) ? swallowed : others).push_back(record);
+    dropWhatTheOtherSideTookOut(others);
     CXDChangeRecords all = mingled(others);
     append(all, mingled(swallowed));
     return all;

@@ -1,0 +1,16 @@
+#pragma once
+
+#include "model/CXDChangeRecord.h"
+
+namespace rolvane {
+
+// What one side takes out of a publication while the other side changes it is out: a contact or group cannot be left
+// half there, changed on the store and gone from the database or the other way round. The records of the other side
+// about it are dropped. Whose change it is does not matter here: records from the store of one's own publication carry
+// the owner's name, whoever wrote them.
+//
+// To be called before mingling, without what the database swallows. Costs one walk when nothing is taken out, and in
+// any case O(records).
+void dropWhatTheOtherSideTookOut(CXDChangeRecords& records);
+
+} // namespace rolvane
