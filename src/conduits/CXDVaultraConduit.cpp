@@ -260,7 +260,7 @@ bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state)
     if (condition.isSound()) {
         prior.set(kTreeDates, state[kTreeDates].dictionary());
         _read.emplace(user, state);
-        if (isOwn && somebodyMayWrite()) _leftovers = removalOfUnlisted(prior, state);
+        if (isOwn) mendOwnTree(prior, state);
         return true;
     }
     CXLog("The tree of %@ %@. %@", isOwn ? *realUserFromUser(user) : user, condition.sentence,
@@ -273,6 +273,21 @@ bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state)
         publishAgain();
     engine().bringSourcesUpToDate(); // after this pass
     return false;
+}
+
+// Single files that are too many or too few: another writer has deleted what somebody else was about to write, or the
+// store has lost them.
+void CXDVaultraConduit::mendOwnTree(const Dictionary& prior, const Dictionary& state) {
+    if (somebodyMayWrite()) _leftovers = removalOfUnlisted(prior, state);
+    for (const UniqueId& name : contactsThatAreMissing(state)) {
+        const CXRecordRef person = _world.rolvane.recordForUniqueId(cxUIDWithTableName(name, kCXPersonTable));
+        if (!person) continue;
+        auto update = std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, CXDUpdateRecord, kSelf, person->uniqueId(),
+                                                        std::nullopt, person->dictionaryRepresentation());
+        update->setAppliesToSources(CXDSyncSourceVaultra);
+        CXLog("The store has lost a contact, which is written again: %@", update);
+        _leftovers.push_back(std::move(update));
+    }
 }
 
 // True when nothing had to be mended, or has been long since. When the last of it is on the store: where nobody but the

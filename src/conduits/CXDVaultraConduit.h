@@ -118,6 +118,7 @@ private:
     void restoreAccessLists();
     bool isMended(const Dictionary& prior, const Dictionary& state);
     bool isToBePublishedAgain();
+    void mendOwnTree(const Dictionary& prior, const Dictionary& state);
     bool somebodyMayWrite(); // besides the owner
     void leaveUnlistedOut(CXDChangeRecords& records);
     void forgetSubscribersRights();

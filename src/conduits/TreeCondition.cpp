@@ -123,6 +123,16 @@ CXDChangeRecordPtr removalOfContact(const UniqueId& person) {
     return ownersChange(CXDDeleteRecord, person, std::nullopt);
 }
 
+std::vector<UniqueId> contactsThatAreMissing(const Dictionary& current) {
+    std::vector<UniqueId> missing;
+    const Array listed = current[kEverybody].dictionary()[kMemberUIDState].array();
+    const Dictionary people = current[kPeopleState].dictionary()[kMemberUIDState].dictionary();
+    if (people.count() >= listed.count()) return missing;
+    for (const Value& name : listed)
+        if (!people.contains(name.string())) missing.emplace_back(name.string());
+    return missing;
+}
+
 ListOfEverybody::ListOfEverybody(const Dictionary& current)
     : _members(current[kEverybody].dictionary()[kMemberUIDState].array()) {
     _names.reserve(_members.count());

@@ -8,6 +8,7 @@
 #include <string>
 #include <string_view>
 #include <unordered_set>
+#include <vector>
 
 // Whether a published tree still is what it was: a store that is restored from an older copy, or that loses files, says
 // the same as somebody who took contacts away. Pure functions over per-user states (see StoreComparison.h), with
@@ -51,6 +52,10 @@ CXDChangeRecords removalOfUnlisted(const Dictionary& prior, const Dictionary& cu
 
 // The same of one contact.
 CXDChangeRecordPtr removalOfContact(const UniqueId& person);
+
+// The contacts that the list of everybody names and that are nowhere in the tree. Looks at nothing but two counts while
+// none is missing and none is there besides.
+std::vector<UniqueId> contactsThatAreMissing(const Dictionary& current);
 
 // The list of everybody of a tree, to be asked for many.
 class ListOfEverybody {

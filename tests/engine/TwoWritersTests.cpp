@@ -12,8 +12,26 @@ protected:
     CXPersonRef personOf(Participant& user, size_t i) { return &user == &bob ? bob.copyOf(crowd[i]) : crowd[i]; }
     CXGroupRef groupOf(Participant& user, size_t i) {
         if (&user == &alice) return circles[i];
+        return copyOf(circles[i]);
+    }
+    CXGroupRef copyOf(const CXGroupRef& group) {
         return std::dynamic_pointer_cast<CXGroup>(
-            bob.application->recordForUniqueId(cxUIDWithTableName(circles[i]->uniqueId(), kCXSubscribedGroupTable)));
+            bob.application->recordForUniqueId(cxUIDWithTableName(group->uniqueId(), kCXSubscribedGroupTable)));
+    }
+    void expectGoneAfterPasses(const UniqueId& uid, const std::vector<Participant*>& passes) {
+        for (Participant* each : passes) each->pass();
+        EXPECT_FALSE(alice.application->recordForUniqueId(uid)) << log.text();
+        EXPECT_EQ(copies(), alice.view());
+        EXPECT_FALSE(std::filesystem::exists(world->file(cxNormalizedUID(uid).str())));
+        for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
+    }
+    void expectToldThatCircleIsGone(Participant& user, const std::string& whose) {
+        const Array told = user.preferences.get(kDaemonDomain, kCXDRefusedChanges).array();
+        ASSERT_EQ(told.count(), 1u) << log.text();
+        const Dictionary refused = told[0].dictionary();
+        EXPECT_EQ(refused[kRefusedUser], Value(whose));
+        EXPECT_EQ(refused[kRefusedWhy], Value(kRefusedAsGroupIsGone));
+        EXPECT_EQ(refused[kRefusedGroup], Value("Circle"));
     }
     void edit(Participant& user, int number, std::mt19937& random) {
         const size_t who = random() % kPeople;
@@ -67,8 +85,7 @@ TEST_F(TwoWriters, AGroupThatItsPublisherDeletedIsNotMadeAgainByTheOthersChange)
     const UniqueId uid = circle->uniqueId();
     alice.pass();
     bob.pass();
-    const auto copy = std::dynamic_pointer_cast<CXGroup>(
-        bob.application->recordForUniqueId(cxUIDWithTableName(uid, kCXSubscribedGroupTable)));
+    const CXGroupRef copy = copyOf(circle);
     ASSERT_TRUE(copy);
     alice.application->removeRecord(circle);
     alice.application->save();
@@ -76,16 +93,99 @@ TEST_F(TwoWriters, AGroupThatItsPublisherDeletedIsNotMadeAgainByTheOthersChange)
     copy->addMember(bob.copyOf(people[1]));
     copy->setValue(Value("Bob's circle"), kCXGroupNameProperty);
     bob.application->save();
-    for (Participant* each : {&bob, &alice, &bob, &alice}) each->pass();
+    expectGoneAfterPasses(uid, {&bob, &alice, &bob, &alice});
+    expectToldThatCircleIsGone(bob, "alice");
+}
+
+// One deletes a group, the other one changes it before having heard of that: it is gone, and nobody gets a part of it
+// back.
+TEST_F(TwoWriters, AGroupThatAWriterDeletedIsGoneWhateverItsOwnerChangesInIt) {
+    const CXGroupRef circle = alice.group("Circle", {people[0]});
+    const UniqueId uid = circle->uniqueId();
+    alice.pass();
+    bob.pass();
+    bob.application->removeRecord(copyOf(circle));
+    bob.application->save();
+    bob.pass();
+    circle->addMember(people[1]);
+    circle->setValue(Value("Alice's circle"), kCXGroupNameProperty);
+    circle->setDistributionIdentifier(people[1]->multiValueForProperty(kCXPhoneProperty)->identifierAtIndex(0),
+                                      kCXPhoneProperty, people[1]);
+    alice.application->save();
+    expectGoneAfterPasses(uid, {&alice, &bob, &alice, &bob});
+    expectToldThatCircleIsGone(alice, kSelf.str());
+}
+
+TEST_F(TwoWriters, AGroupThatItsOwnerDeletedIsGoneWhateverAWriterHasChangedInIt) {
+    const CXGroupRef circle = alice.group("Circle", {people[0]});
+    const UniqueId uid = circle->uniqueId();
+    alice.pass();
+    bob.pass();
+    copyOf(circle)->addMember(bob.copyOf(people[1]));
+    copyOf(circle)->setValue(Value("Bob's circle"), kCXGroupNameProperty);
+    bob.application->save();
+    bob.pass();
+    alice.application->removeRecord(circle);
+    alice.application->save();
+    expectGoneAfterPasses(uid, {&alice, &bob, &alice, &bob});
+}
+
+TEST_F(TwoWriters, AGroupThatAWriterDeletesIsGoneWhateverItsOwnerHasChangedInIt) {
+    const CXGroupRef circle = alice.group("Circle", {people[0]});
+    const UniqueId uid = circle->uniqueId();
+    alice.pass();
+    bob.pass();
+    circle->addMember(people[1]);
+    alice.application->save();
+    alice.pass();
+    bob.application->removeRecord(copyOf(circle));
+    bob.application->save();
+    expectGoneAfterPasses(uid, {&bob, &alice, &bob, &alice});
+}
+
+// The owner's change is written without a look at what else is new on the store, as after each save.
+TEST_F(TwoWriters, AnOwnersChangeDoesNotMakeAPartOfAGroupThatAWriterDeletedInTheMeantime) {
+    const CXGroupRef circle = alice.group("Circle", {people[0]});
+    const UniqueId uid = circle->uniqueId();
+    alice.pass();
+    bob.pass();
+    std::filesystem::remove(world->file(uid.str()));
+    auto change =
+        std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, CXDAddRecordToGroup, kSelf, people[1]->uniqueId(), uid);
+    change->setAppliesToSources(CXDSyncSourceVaultra);
+    alice.engine->applyChangeRecords({change}, true);
+    EXPECT_FALSE(std::filesystem::exists(world->file(uid.str())));
+    EXPECT_TRUE(alice.engine->getPendingChanges().empty());
+    expectToldThatCircleIsGone(alice, kSelf.str());
+}
+
+// A writer who did not know that the contact is deleted has written it once more.
+TEST_F(TwoWriters, AContactThatLiesInTheTreeAndIsInNoListIsTakenInByNobodyAndTakenAway) {
+    bob.pass();
+    const UniqueId uid("5C0FFEE5-0000-4000-8000-000000000001:CXPerson");
+    const auto file = fileOf(uid);
+    std::filesystem::create_directories(file.parent_path());
+    rewrite(file, textOf(fileOf(people[0])));
+    setDate(file, dateOf(fileOf(people[0])) + 10);
+    bob.pass();
+    EXPECT_FALSE(bob.application->recordForUniqueId(cxUIDWithTableName(uid, kCXSubscribedPersonTable))) << log.text();
+    alice.pass();
     EXPECT_FALSE(alice.application->recordForUniqueId(uid)) << log.text();
+    EXPECT_FALSE(std::filesystem::exists(file));
     EXPECT_EQ(copies(), alice.view());
-    EXPECT_FALSE(std::filesystem::exists(world->file(cxNormalizedUID(uid).str())));
-    const Array told = bob.preferences.get(kDaemonDomain, kCXDRefusedChanges).array();
-    ASSERT_EQ(told.count(), 1u) << log.text();
-    const Dictionary refused = told[0].dictionary();
-    EXPECT_EQ(refused[kRefusedUser], Value("alice"));
-    EXPECT_EQ(refused[kRefusedWhy], Value(kRefusedAsGroupIsGone));
-    EXPECT_EQ(refused[kRefusedGroup], Value("Circle"));
+    for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
+}
+
+TEST_F(TwoWriters, AContactsFileThatTheStoreHasLostIsWrittenAgainByItsOwner) {
+    bob.pass();
+    const auto file = fileOf(people[1]);
+    const std::string before = textOf(file);
+    std::filesystem::remove(file);
+    alice.pass();
+    EXPECT_EQ(contentOf(file), PropertyList::fromXML(before).dictionary()) << log.text();
+    EXPECT_TRUE(alice.application->recordForUniqueId(people[1]->uniqueId()));
+    bob.pass();
+    EXPECT_EQ(copies(), alice.view());
     for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
 }
 
