@@ -82,7 +82,7 @@ std::string refusalReason(const Json& record) {
                                       : fmt::format("the group \"{}\"", record["group"].get<std::string>());
         return fmt::format("{} has deleted {} meanwhile, so what you changed in it was given up. Make another group "
                            "to keep its people together.",
-                           user, group);
+                           user == kSelf.str() ? "somebody else who may write" : user, group);
     }
     if (record["why"] == kRefusedForItsName)
         return "the store keeps files of its own under that identifier. The change stays in this database.";

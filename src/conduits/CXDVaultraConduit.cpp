@@ -170,6 +170,7 @@ void CXDVaultraConduit::open() {
     }
     _lastSyncDate = _world.preferences.get(kDaemonDomain, kLastSyncDateKey).date().value_or(Date::distantPast());
     if (_vaultraOffLine) return;
+    _isWrittenByOthers = somebodyMayWrite();
     forgetSubscribersRights();
     const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
     _world.manager.keepSerialNumber(users[kSelf.str()].dictionary()[kSerialNumber].string());
@@ -278,7 +279,7 @@ bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state)
 // Single files that are too many or too few: another writer has deleted what somebody else was about to write, or the
 // store has lost them.
 void CXDVaultraConduit::mendOwnTree(const Dictionary& prior, const Dictionary& state) {
-    if (somebodyMayWrite()) _leftovers = removalOfUnlisted(prior, state);
+    if (_isWrittenByOthers) _leftovers = removalOfUnlisted(prior, state);
     for (const UniqueId& name : contactsThatAreMissing(state)) {
         const CXRecordRef person = _world.rolvane.recordForUniqueId(cxUIDWithTableName(name, kCXPersonTable));
         if (!person) continue;
@@ -329,7 +330,7 @@ void CXDVaultraConduit::leaveUnlistedOut(CXDChangeRecords& records) {
         if (lists.try_emplace(*record->user(), read->second).first->second.names(shared)) return false;
         if (_world.rolvane.recordForUniqueId(*record->person())) return false;
         CXDLog("Not listed, and left out: %@", record);
-        if (record->user() == kSelf && somebodyMayWrite()) _leftovers.push_back(removalOfContact(shared));
+        if (record->user() == kSelf && _isWrittenByOthers) _leftovers.push_back(removalOfContact(shared));
         return true;
     });
 }
@@ -457,7 +458,7 @@ bool CXDVaultraConduit::makeCompositeGroupChange(CXDChangeRecord& record, int& c
 // it would bring it back without its name and members. The change is given up. Where the store has lost the state of an
 // own group, the next look at the tree finds that out, and all of it is published again.
 bool CXDVaultraConduit::wasDeletedThere(CXDChangeRecord& record) {
-    if (!record.user() || !record.group()) return false;
+    if (!record.user() || !record.group() || (record.changeMadeByDataOwner() && !_isWrittenByOthers)) return false;
     const Dictionary known = engine().knownGroupState(kConduitVaultra, *record.user(), *record.group());
     if (known.empty()) return false;
     int code = 0;

@@ -144,9 +144,10 @@ private:
 
     World _world;
     std::atomic<bool> _vaultraOffLine = false;
-    CXDChangeRecords _leftovers;          // of the gathering that is under way
-    std::map<UserName, Dictionary> _read; // so far: the states of known users
-    bool _gathering = false;              // `open` belongs to a gathering
+    std::atomic<bool> _isWrittenByOthers = false; // the own tree, as of the last open
+    CXDChangeRecords _leftovers;                  // of the gathering that is under way
+    std::map<UserName, Dictionary> _read;         // so far: the states of known users
+    bool _gathering = false;                      // `open` belongs to a gathering
     std::mutex _structureLock;
     std::future<void> _structure; // the look at the own tree that is under way; guarded by _structureLock
     // The account is the manager's for good, and every record asks for its user's base location several times.

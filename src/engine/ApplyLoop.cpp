@@ -177,7 +177,11 @@ CXDChangeRecords ApplyLoop::accepted() {
     CXDChangeRecords swallowed, others;
     for (const CXDChangeRecordPtr& record : _unhandled)
         (_parts.conduits.cx->swallows(*record) ? swallowed : others).push_back(record);
-    dropWhatTheOtherSideTookOut(others);
+    for (const GroupThatIsGone& gone : dropWhatTheOtherSideTookOut(others)) {
+        const Dictionary known = _parts.state.conduitData()[kConduitVaultra].dictionary()[kPriorState].dictionary();
+        const Value& name = known[gone.user.str()].dictionary()[gone.group.str()].dictionary()[kCXGroupNameProperty];
+        _parts.state.noteRefused({gone.user, kRefusedAsGroupIsGone, name.string()});
+    }
     CXDChangeRecords all = mingled(others);
     append(all, mingled(swallowed));
     return all;

@@ -7,6 +7,7 @@
 
 #include <algorithm>
 #include <functional>
+#include <set>
 #include <unordered_map>
 #include <utility>
 
@@ -79,21 +80,26 @@ void forgetAdditions(CXDChangeRecord& composite, const TakenOut& takenOut) {
 
 } // namespace
 
-void dropWhatTheOtherSideTookOut(CXDChangeRecords& records) {
+std::vector<GroupThatIsGone> dropWhatTheOtherSideTookOut(CXDChangeRecords& records) {
     TakenOut takenOut;
     for (const CXDChangeRecordPtr& record : records) takenOut.add(*record);
-    if (takenOut.empty()) return;
+    if (takenOut.empty()) return {};
 
+    std::set<GroupThatIsGone> changedHere;
     std::erase_if(records, [&](const CXDChangeRecordPtr& record) {
-        const bool isDropped = takenOut.byOtherThan(*record, record->group())
-                                   ? !takenOutBy(*record)
-                                   : !isRemoval(*record) && takenOut.byOtherThan(*record, record->person());
-        if (isDropped)
-            CXDLog("Rejecting %@", record);
-        else if (record->type() == CXDCompositeGroupChange)
-            forgetAdditions(*record, takenOut);
-        return isDropped;
+        const bool ofGroup = takenOut.byOtherThan(*record, record->group());
+        const bool isDropped =
+            ofGroup ? !takenOutBy(*record) : !isRemoval(*record) && takenOut.byOtherThan(*record, record->person());
+        if (!isDropped) {
+            if (record->type() == CXDCompositeGroupChange) forgetAdditions(*record, takenOut);
+            return false;
+        }
+        CXDLog("Rejecting %@", record);
+        if (ofGroup && record->initialSource() == CXDSyncSourceCX && record->user())
+            changedHere.insert({*record->user(), cxNormalizedUID(*record->group())});
+        return true;
     });
+    return {changedHere.begin(), changedHere.end()};
 }
 
 } // namespace rolvane

@@ -13,6 +13,6 @@ struct Refusal {
     std::string group = {}; // the name of the group that is gone
 };
 inline constexpr const char* kRefusedForItsName = "name";           // a name of the published tree's own
-inline constexpr const char* kRefusedAsGroupIsGone = "groupIsGone"; // its publisher has deleted it
+inline constexpr const char* kRefusedAsGroupIsGone = "groupIsGone"; // somebody else has deleted it
 
 } // namespace rolvane

@@ -119,7 +119,7 @@ TEST_F(HostileTree, LinksFoldersAndTheTreesOwnNamesInABucketAreNoContacts) {
 }
 
 TEST_F(HostileTree, ContactFilesThatAreNoneAreToldOfOnceAndTheRestGoesOn) {
-    bob.pass();
+    alice.pass();
     std::string deep = "<?xml version=\"1.0\"?><plist version=\"1.0\">";
     for (int i = 0; i < 5000; ++i) deep += "<array>";
     for (int i = 0; i < 5000; ++i) deep += "</array>";
