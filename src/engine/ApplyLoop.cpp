@@ -10,7 +10,6 @@
 #include "engine/Mingler.h"
 #include "engine/OutOfOrderWork.h"
 #include "engine/PublicationCache.h"
-#include "engine/TakenOut.h"
 #include "engine/UnderWay.h"
 #include "engine/UnsettledGroups.h"
 #include "foundation/CXException.h"
@@ -177,7 +176,8 @@ CXDChangeRecords ApplyLoop::accepted() {
     CXDChangeRecords swallowed, others;
     for (const CXDChangeRecordPtr& record : _unhandled)
         (_parts.conduits.cx->swallows(*record) ? swallowed : others).push_back(record);
-    for (const GroupThatIsGone& gone : dropWhatTheOtherSideTookOut(others)) {
+    _takenOut = TakenOut(others);
+    for (const GroupThatIsGone& gone : _takenOut.drop(others)) {
         const Dictionary known = _parts.state.conduitData()[kConduitVaultra].dictionary()[kPriorState].dictionary();
         const Value& name = known[gone.user.str()].dictionary()[gone.group.str()].dictionary()[kCXGroupNameProperty];
         _parts.state.noteRefused({gone.user, kRefusedAsGroupIsGone, name.string()});
@@ -260,6 +260,18 @@ bool ApplyLoop::meetsOwnWaitingWrite(const CXDChangeRecord& record) {
            _waitingWrites->contains({record.user().value_or(UserName()), cxNormalizedUID(*record.person())});
 }
 
+// A change of another user's publication that concerns what is deleted here. Where the deletion was refused, the change
+// is what brings it back. Elsewhere it is left, and offered again should there be anything of it.
+bool ApplyLoop::isOfWhatWasTakenOutHere(const CXDChangeRecord& record) {
+    if (record.initialSource() == CXDSyncSourceCX || !_takenOut.concerns(record)) return false;
+    if (!_refusedUsers) {
+        _refusedUsers.emplace();
+        for (const CXDChangeRecordPtr& refused : _parts.denied.all())
+            _refusedUsers->insert(refused->user().value_or(UserName()));
+    }
+    return !_refusedUsers->contains(record.user().value_or(UserName()));
+}
+
 // Once a pass: what is noted then is good for all saves that follow.
 void ApplyLoop::noteArrivals() {
     if (std::exchange(_arrivalsNoted, true)) return;
@@ -277,6 +289,9 @@ void ApplyLoop::applyInOrder(const CXDChangeRecordPtr& record) {
     int32_t left = record->appliesToSources();
     if (!_parts.terminating && meetsOwnWaitingWrite(*record)) {
         CXDLog("%@ waits until our own version is written", record);
+        left = 0;
+    } else if (!_parts.terminating && isOfWhatWasTakenOutHere(*record)) {
+        CXDLog("%@ is out", record);
         left = 0;
     } else if (!_parts.terminating) {
         if ((left & CXDSyncSourceCX) && applyTo(*_parts.conduits.cx, CXDSyncSourceCX, record)) left &= ~CXDSyncSourceCX;

@@ -1,6 +1,7 @@
 #pragma once
 
 #include "engine/EngineParts.h"
+#include "engine/TakenOut.h"
 #include "engine/UnderWay.h"
 #include "model/CXDChangeRecord.h"
 
@@ -49,6 +50,7 @@ private:
     void noteArrivals();
     void claimState();
     bool meetsOwnWaitingWrite(const CXDChangeRecord& record);
+    bool isOfWhatWasTakenOutHere(const CXDChangeRecord& record);
     bool applyTo(CXDConduit& conduit, int32_t source, const CXDChangeRecordPtr& record);
     void cancelLike(const CXDChangeRecordPtr& record);
     void cleanUp();
@@ -75,6 +77,8 @@ private:
     bool _denied = false; // handed to every in-order apply; never cleared in a pass
     std::unordered_set<UserName> _cancelledUsers;
     std::optional<std::set<std::pair<UserName, UniqueId>>> _waitingWrites; // of contacts, that the workers left
+    TakenOut _takenOut;
+    std::optional<std::set<UserName>> _refusedUsers; // whose store has refused something to the workers
     size_t _totalCount = 0, _processedCount = 0;
 };
 

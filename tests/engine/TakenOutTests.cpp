@@ -17,15 +17,28 @@ constexpr RecordShape there(const char* user) {
 }
 
 CXDChangeRecords left(CXDChangeRecords records) {
-    dropWhatTheOtherSideTookOut(records);
+    TakenOut(records).drop(records);
     return records;
 }
 
-class TakenOut : public testing::TestWithParam<const char*> {};
-INSTANTIATE_TEST_SUITE_P(Users, TakenOut, testing::Values("<self>", "ann"),
+// What is left of a pass in the end. Of somebody else's publication the changes that arrive are left until it is known
+// whether the deletion was let through.
+void expectOnlyLeft(const CXDChangeRecords& records, const CXDChangeRecords& expected) {
+    const TakenOut takenOut(records);
+    CXDChangeRecords rest = records;
+    takenOut.drop(rest);
+    if (!records[0]->changeMadeByDataOwner()) {
+        EXPECT_EQ(rest, records);
+    }
+    std::erase_if(rest, [&](const CXDChangeRecordPtr& record) { return takenOut.concerns(*record); });
+    EXPECT_EQ(rest, expected);
+}
+
+class WhatIsTakenOut : public testing::TestWithParam<const char*> {};
+INSTANTIATE_TEST_SUITE_P(Users, WhatIsTakenOut, testing::Values("<self>", "ann"),
                          [](const auto& user) { return user.index == 0 ? "Own" : "AnothersTree"; });
 
-TEST_P(TakenOut, NothingIsDroppedWhereNothingIsTakenOut) {
+TEST_P(WhatIsTakenOut, NothingIsDroppedWhereNothingIsTakenOut) {
     const CXDChangeRecords records = {
         makeRecord(CXDUpdateRecord, "P1:CXPerson", nullptr, here(GetParam())),
         makeRecord(CXDUpdateRecord, "P1:CXPerson", nullptr, there(GetParam())),
@@ -34,7 +47,7 @@ TEST_P(TakenOut, NothingIsDroppedWhereNothingIsTakenOut) {
     EXPECT_EQ(left(records), records);
 }
 
-TEST_P(TakenOut, OfAGroupThatTheStoreHasNoLongerNoChangeOfItsOwnIsLeft) {
+TEST_P(WhatIsTakenOut, OfAGroupThatTheStoreHasNoLongerNoChangeOfItsOwnIsLeft) {
     const auto removal = makeRecord(CXDRemoveGroupFromGroup, "G1:CXGroup", "AllCXGroup", there(GetParam()));
     const auto member = makeRecord(CXDRemoveRecordFromGroup, "P1:CXPerson", "G1:CXGroup", there(GetParam()));
     const auto other = makeRecord(CXDAddRecordToGroup, "P2:CXPerson", "G2:CXGroup", here(GetParam()));
@@ -49,28 +62,28 @@ TEST_P(TakenOut, OfAGroupThatTheStoreHasNoLongerNoChangeOfItsOwnIsLeft) {
     EXPECT_EQ(left(records), (CXDChangeRecords{other, member, removal}));
 }
 
-TEST_P(TakenOut, OfAGroupThatIsDeletedHereNoChangeOnTheStoreIsTakenIn) {
+TEST_P(WhatIsTakenOut, OfAGroupThatIsDeletedHereNoChangeOnTheStoreIsTakenIn) {
     const auto deletion = makeRecord(CXDDeleteGroup, nullptr, "G1:CXGroup", here(GetParam()));
     CXDChangeRecords records = {
         deletion, makeRecord(CXDAddRecordToGroup, "P1:CXSubscribedPerson", "G1:CXSubscribedGroup", there(GetParam())),
         makeRecord(CXDRemoveRecordFromGroup, "P2:CXPerson", "G1:CXGroup", there(GetParam())),
         makeRecord(CXDChangeGroupName, nullptr, "G1:CXGroup", there(GetParam()))};
-    EXPECT_EQ(left(records), CXDChangeRecords{deletion});
+    expectOnlyLeft(records, {deletion});
 }
 
-TEST_P(TakenOut, AContactThatOneSideTakesOutIsOutOnBoth) {
+TEST_P(WhatIsTakenOut, AContactThatOneSideTakesOutIsOutOnBoth) {
     const auto removal = makeRecord(CXDRemoveRecordFromGroup, "P1:CXPerson", "AllCXGroup", there(GetParam()));
     const auto leaving = makeRecord(CXDRemoveRecordFromGroup, "P1:CXPerson", "G1:CXGroup", here(GetParam()));
     EXPECT_EQ(left({makeRecord(CXDUpdateRecord, "P1:CXPerson", nullptr, here(GetParam())),
                     makeRecord(CXDAddRecordToGroup, "P1:CXPerson", "G1:CXGroup", here(GetParam())), leaving, removal}),
               (CXDChangeRecords{leaving, removal}));
     const auto deletion = makeRecord(CXDDeleteRecord, "P1:CXPerson", nullptr, here(GetParam()));
-    EXPECT_EQ(left({deletion, makeRecord(CXDUpdateRecord, "P1:CXSubscribedPerson", nullptr, there(GetParam())),
-                    makeRecord(CXDUpdateDistributionList, "P1:CXPerson", "G1:CXGroup", there(GetParam()))}),
-              CXDChangeRecords{deletion});
+    expectOnlyLeft({deletion, makeRecord(CXDUpdateRecord, "P1:CXSubscribedPerson", nullptr, there(GetParam())),
+                    makeRecord(CXDUpdateDistributionList, "P1:CXPerson", "G1:CXGroup", there(GetParam()))},
+                   {deletion});
 }
 
-TEST_P(TakenOut, WhatBothTakeOutIsTakenOutByBoth) {
+TEST_P(WhatIsTakenOut, WhatBothTakeOutIsTakenOutByBoth) {
     const CXDChangeRecords records = {
         makeRecord(CXDDeleteGroup, nullptr, "G1:CXGroup", here(GetParam())),
         makeRecord(CXDRemoveGroupFromGroup, "G1:CXGroup", "AllCXGroup", here(GetParam())),
@@ -80,19 +93,19 @@ TEST_P(TakenOut, WhatBothTakeOutIsTakenOutByBoth) {
     EXPECT_EQ(left(records), records);
 }
 
-TEST_P(TakenOut, WhatOneSideTakesOutAndMakesAgainStays) {
+TEST_P(WhatIsTakenOut, WhatOneSideTakesOutAndMakesAgainStays) {
     const CXDChangeRecords records = {makeRecord(CXDDeleteGroup, nullptr, "G1:CXGroup", here(GetParam())),
                                       makeRecord(CXDCreateStructureForGroup, nullptr, "G1:CXGroup", here(GetParam()))};
     EXPECT_EQ(left(records), records);
 }
 
-TEST_P(TakenOut, ATreeOfSomebodyElseIsNotConcerned) {
+TEST_P(WhatIsTakenOut, ATreeOfSomebodyElseIsNotConcerned) {
     const CXDChangeRecords records = {makeRecord(CXDDeleteGroup, nullptr, "G1:CXGroup", here(GetParam())),
                                       makeRecord(CXDChangeGroupName, nullptr, "G1:CXGroup", there("zoe"))};
     EXPECT_EQ(left(records), records);
 }
 
-TEST_P(TakenOut, AWaitingChangeOfAGroupForgetsTheMembersThatAreOut) {
+TEST_P(WhatIsTakenOut, AWaitingChangeOfAGroupForgetsTheMembersThatAreOut) {
     const auto waiting = makeRecord(CXDCompositeGroupChange, nullptr, "G1:CXGroup", here(GetParam()));
     waiting->setPayload(Dictionary{{kMemberAdds, Array{"P1:CXPerson", "P2:CXPerson"}}, {kCXGroupNameProperty, "Ours"}});
     const auto removal = makeRecord(CXDRemoveRecordFromGroup, "P1:CXPerson", "AllCXGroup", there(GetParam()));
