@@ -151,6 +151,10 @@ bool CXDCXConduit::updateRecord(const CXDChangeRecordPtr& record) {
         if (person && person->isSubscribed())
             content.set(kCXRemoteLocationProperty, person->valueForProperty(kCXRemoteLocationProperty));
     }
+    if (!person && hasUncapturedEdit(uid)) {
+        CXDLog("%@ has been deleted here meanwhile", record); // which is told to others after the pass
+        return true;
+    }
     if (!person) {
         person = CXPerson::initWithUniqueId(uid);
         rolvane().addRecord(person);

@@ -159,6 +159,31 @@ TEST_F(TwoWriters, AnOwnersChangeDoesNotMakeAPartOfAGroupThatAWriterDeletedInThe
     expectToldThatCircleIsGone(alice, kSelf.str());
 }
 
+TEST_F(TwoWriters, AContactThatIsDeletedHereWhileAnEditOfItArrivesStaysDeletedAndIsDeletedThere) {
+    bob.pass();
+    const UniqueId uid = people[0]->uniqueId();
+    people[0]->setValue(Value("Adah"), kCXFirstNameProperty);
+    alice.application->save();
+    alice.pass();
+    std::atomic<bool> deleted = false;
+    bob.wire->intercept([&](const HttpRequest& request) -> std::optional<HttpResponse> {
+        const bool reads = request.url.encodedPath().find(std::string(cxUUIDPart(uid))) != std::string::npos;
+        if (request.method == "GET" && reads && !deleted.exchange(true)) {
+            bob.application->removeRecord(bob.copyOf(people[0]));
+            bob.application->save();
+        }
+        return std::nullopt;
+    });
+    bob.pass();
+    ASSERT_TRUE(deleted) << bob.wire->text();
+    EXPECT_FALSE(bob.application->recordForUniqueId(cxUIDWithTableName(uid, kCXSubscribedPersonTable))) << log.text();
+    for (Participant* each : {&bob, &alice, &bob, &alice}) each->pass();
+    EXPECT_FALSE(alice.application->recordForUniqueId(uid)) << log.text();
+    EXPECT_FALSE(std::filesystem::exists(fileOf(uid)));
+    EXPECT_EQ(copies(), alice.view());
+    for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
+}
+
 // A writer who did not know that the contact is deleted has written it once more.
 TEST_F(TwoWriters, AContactThatLiesInTheTreeAndIsInNoListIsTakenInByNobodyAndTakenAway) {
     bob.pass();
