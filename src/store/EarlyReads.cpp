@@ -106,7 +106,7 @@ std::optional<HttpResponse> EarlyReads::take(const Url& url) {
     std::optional<HttpResponse> answer;
     {
         std::unique_lock lock(_shelf->mutex);
-        const std::string name = url.absoluteString();
+        const std::string& name = url.absoluteString();
         auto found = _shelf->places.find(name);
         if (found == _shelf->places.end()) return std::nullopt;
         const Shelf::PlaceRef place = found->second;
