@@ -280,6 +280,7 @@ bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state)
 // store has lost them.
 void CXDVaultraConduit::mendOwnTree(const Dictionary& prior, const Dictionary& state) {
     if (_isWrittenByOthers) _leftovers = removalOfUnlisted(prior, state);
+    if (!allGroupHas(kCXRemoteLocationProperty)) return; // the list may be older than the withdrawal
     for (const UniqueId& name : contactsThatAreMissing(state)) {
         const CXRecordRef person = _world.rolvane.recordForUniqueId(cxUIDWithTableName(name, kCXPersonTable));
         if (!person) continue;
@@ -304,8 +305,13 @@ bool CXDVaultraConduit::isMended(const Dictionary& prior, const Dictionary& stat
 }
 
 bool CXDVaultraConduit::somebodyMayWrite() {
-    const auto writers = _world.rolvane.allGroup()->multiValueForProperty(kCXReadWriteSharingACLProperty);
-    return writers && !writers->empty();
+    return allGroupHas(kCXReadWriteSharingACLProperty);
+}
+
+// Empty lists stay where somebody was or something stood once.
+bool CXDVaultraConduit::allGroupHas(const char* property) {
+    const auto entries = _world.rolvane.allGroup()->multiValueForProperty(property);
+    return entries && !entries->empty();
 }
 
 CXDChangeRecords CXDVaultraConduit::changeRecords() {
@@ -321,13 +327,13 @@ CXDChangeRecords CXDVaultraConduit::changeRecords() {
 // written once more by somebody who did not know. Whoever knows it reads what is written. Nobody else takes it in: it
 // would stay behind when its file goes. From the own tree it is taken away.
 void CXDVaultraConduit::leaveUnlistedOut(CXDChangeRecords& records) {
-    std::map<UserName, ListOfEverybody> lists;
+    std::map<UserName, ListedContacts> lists;
     std::erase_if(records, [&](const CXDChangeRecordPtr& record) {
         if (record->type() != CXDUpdateRecord || !record->person() || !record->user()) return false;
         const auto read = _read.find(*record->user());
         if (read == _read.end()) return false;
         const UniqueId shared = cxNormalizedUID(*record->person());
-        if (lists.try_emplace(*record->user(), read->second).first->second.names(shared)) return false;
+        if (lists.try_emplace(*record->user(), read->second).first->second.contains(shared)) return false;
         if (_world.rolvane.recordForUniqueId(*record->person())) return false;
         CXDLog("Not listed, and left out: %@", record);
         if (record->user() == kSelf && _isWrittenByOthers) _leftovers.push_back(removalOfContact(shared));

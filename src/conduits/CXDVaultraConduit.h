@@ -120,6 +120,7 @@ private:
     bool isToBePublishedAgain();
     void mendOwnTree(const Dictionary& prior, const Dictionary& state);
     bool somebodyMayWrite(); // besides the owner
+    bool allGroupHas(const char* property);
     void leaveUnlistedOut(CXDChangeRecords& records);
     void forgetSubscribersRights();
     void noteUnsavedAccessLists();

@@ -133,15 +133,11 @@ std::vector<UniqueId> contactsThatAreMissing(const Dictionary& current) {
     return missing;
 }
 
-ListOfEverybody::ListOfEverybody(const Dictionary& current)
-    : _members(current[kEverybody].dictionary()[kMemberUIDState].array()) {
-    _names.reserve(_members.count());
-    for (const Value& member : _members)
+ListedContacts::ListedContacts(const Dictionary& current)
+    : _list(current[kEverybody].dictionary()[kMemberUIDState].array()) {
+    _names.reserve(_list.count());
+    for (const Value& member : _list)
         if (const std::string* name = member.stringIf()) _names.insert(*name);
-}
-
-bool ListOfEverybody::names(const UniqueId& person) const {
-    return _names.contains(person.str());
 }
 
 } // namespace rolvane

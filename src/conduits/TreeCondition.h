@@ -57,15 +57,16 @@ CXDChangeRecordPtr removalOfContact(const UniqueId& person);
 // none is missing and none is there besides.
 std::vector<UniqueId> contactsThatAreMissing(const Dictionary& current);
 
-// The list of everybody of a tree, to be asked for many.
-class ListOfEverybody {
+// The contacts that the list of everybody names, to be asked for many. Where single groups are published, it names who
+// is in them.
+class ListedContacts {
 public:
-    explicit ListOfEverybody(const Dictionary& current);
-    bool names(const UniqueId& person) const;
+    explicit ListedContacts(const Dictionary& current);
+    bool contains(const UniqueId& person) const { return _names.contains(person.str()); }
 
 private:
-    Array _members;
-    std::unordered_set<std::string_view> _names;
+    Array _list;
+    std::unordered_set<std::string_view> _names; // in the list
 };
 
 } // namespace rolvane

@@ -214,6 +214,18 @@ TEST_F(TwoWriters, AContactsFileThatTheStoreHasLostIsWrittenAgainByItsOwner) {
     for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
 }
 
+TEST_F(TwoWriters, AContactsFileIsNotWrittenAgainWhereNotEverybodyIsPublished) {
+    CXMutableMultiValue locations;
+    locations.addValue(alice.base, kCXPublishLabel);
+    friends->setValue(locations, kCXRemoteLocationProperty);
+    alice.application->allGroup()->setValue(CXMultiValue(), kCXRemoteLocationProperty);
+    alice.application->save();
+    const auto file = fileOf(people[1]);
+    std::filesystem::remove(file);
+    alice.pass();
+    EXPECT_FALSE(std::filesystem::exists(file)) << log.text();
+}
+
 TEST_F(TwoWriters, AfterFiveHundredEditsEachBothDatabasesAndTheStoreAreEqual) {
     constexpr int kEdits = 500;
     std::mt19937 random(20260611);
