@@ -281,15 +281,17 @@ bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state)
 void CXDVaultraConduit::mendOwnTree(const Dictionary& prior, const Dictionary& state) {
     if (_isWrittenByOthers) _leftovers = removalOfUnlisted(prior, state);
     if (!allGroupHas(kCXRemoteLocationProperty)) return; // the list may be older than the withdrawal
+    size_t written = 0;
     for (const UniqueId& name : contactsThatAreMissing(state)) {
         const CXRecordRef person = _world.rolvane.recordForUniqueId(cxUIDWithTableName(name, kCXPersonTable));
         if (!person) continue;
         auto update = std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, CXDUpdateRecord, kSelf, person->uniqueId(),
                                                         std::nullopt, person->dictionaryRepresentation());
         update->setAppliesToSources(CXDSyncSourceVaultra);
-        CXLog("The store has lost a contact, which is written again: %@", update);
         _leftovers.push_back(std::move(update));
+        ++written;
     }
+    if (written > 0) CXLog("The store has lost the files of %@ contacts, which are written again.", written);
 }
 
 // True when nothing had to be mended, or has been long since. When the last of it is on the store: where nobody but the

@@ -31,6 +31,22 @@ protected:
         }
         return count;
     }
+    template <class Moment>
+    void subscribeAnewDuringAPassAt(Moment&& moment) {
+        std::atomic<bool> once = true;
+        bob.wire->intercept([&](const HttpRequest& request) -> std::optional<HttpResponse> {
+            if (moment(request) && once.exchange(false)) subscribeAnew();
+            return std::nullopt;
+        });
+        bob.pass();
+        ASSERT_FALSE(once);
+        bob.wire->clear();
+        bob.pass();
+        bob.database->deliverExternalChanges();
+        bob.pass();
+        expectEverythingHereAgainAndNothingWritten();
+        bob.wire->intercept({});
+    }
     void expectEverythingHereAgainAndNothingWritten() {
         EXPECT_EQ(copies(), alice.view()) << log.text();
         EXPECT_EQ(writesToAlicesTree(), 0u) << bob.wire->text();
@@ -90,36 +106,15 @@ TEST_F(Resubscribing, ToWhatCouldNeverBeReadIsNoRevokedSubscription) {
 // The journal's entries are then older than the last sync: they are delivered behind the pass that has brought the
 // copies again.
 TEST_F(Resubscribing, DuringAPassTakesNothingFromThePublisher) {
-    std::atomic<bool> once = true;
-    bob.wire->intercept([&](const HttpRequest& request) -> std::optional<HttpResponse> {
-        // of a group or its access list: asked when the own changes have been gathered already
-        if (request.method == "PROPFIND" && request.url.path().find("CXGroup") != std::string::npos &&
-            request.url.path().find("/alice/") != std::string::npos && once.exchange(false))
-            subscribeAnew();
-        return std::nullopt;
+    // of a group or its access list: asked when the own changes have been gathered already
+    subscribeAnewDuringAPassAt([](const HttpRequest& request) {
+        return request.method == "PROPFIND" && request.url.path().find("CXGroup") != std::string::npos &&
+               request.url.path().find("/alice/") != std::string::npos;
     });
-    bob.pass();
-    ASSERT_FALSE(once);
-    bob.wire->clear();
-    bob.pass();
-    bob.database->deliverExternalChanges();
-    bob.pass();
-    expectEverythingHereAgainAndNothingWritten();
 }
 
 TEST_F(Resubscribing, WhileAPassOpensTakesNothingFromThePublisher) {
-    std::atomic<bool> once = true;
-    bob.wire->intercept([&](const HttpRequest& request) -> std::optional<HttpResponse> {
-        if (request.method == "OPTIONS" && once.exchange(false)) subscribeAnew();
-        return std::nullopt;
-    });
-    bob.pass();
-    ASSERT_FALSE(once);
-    bob.wire->clear();
-    bob.pass();
-    bob.database->deliverExternalChanges();
-    bob.pass();
-    expectEverythingHereAgainAndNothingWritten();
+    subscribeAnewDuringAPassAt([](const HttpRequest& request) { return request.method == "OPTIONS"; });
 }
 
 TEST_F(Resubscribing, DropsTheChangesThatWaitedForTheFormerSubscription) {

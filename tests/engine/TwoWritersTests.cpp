@@ -18,6 +18,12 @@ protected:
         return std::dynamic_pointer_cast<CXGroup>(
             bob.application->recordForUniqueId(cxUIDWithTableName(group->uniqueId(), kCXSubscribedGroupTable)));
     }
+    CXGroupRef circleOfBoth() {
+        const CXGroupRef circle = alice.group("Circle", {people[0]});
+        alice.pass();
+        bob.pass();
+        return circle;
+    }
     void expectGoneAfterPasses(const UniqueId& uid, const std::vector<Participant*>& passes) {
         for (Participant* each : passes) each->pass();
         EXPECT_FALSE(alice.application->recordForUniqueId(uid)) << log.text();
@@ -81,10 +87,8 @@ TEST_F(TwoWriters, AnEditThatWaitsAndAnotherOneThatArrivesMeanwhileEndWithOneVal
 }
 
 TEST_F(TwoWriters, AGroupThatItsPublisherDeletedIsNotMadeAgainByTheOthersChange) {
-    const CXGroupRef circle = alice.group("Circle", {people[0]});
+    const CXGroupRef circle = circleOfBoth();
     const UniqueId uid = circle->uniqueId();
-    alice.pass();
-    bob.pass();
     const CXGroupRef copy = copyOf(circle);
     ASSERT_TRUE(copy);
     alice.application->removeRecord(circle);
@@ -100,10 +104,8 @@ TEST_F(TwoWriters, AGroupThatItsPublisherDeletedIsNotMadeAgainByTheOthersChange)
 // One deletes a group, the other one changes it before having heard of that: it is gone, and nobody gets a part of it
 // back.
 TEST_F(TwoWriters, AGroupThatAWriterDeletedIsGoneWhateverItsOwnerChangesInIt) {
-    const CXGroupRef circle = alice.group("Circle", {people[0]});
+    const CXGroupRef circle = circleOfBoth();
     const UniqueId uid = circle->uniqueId();
-    alice.pass();
-    bob.pass();
     bob.application->removeRecord(copyOf(circle));
     bob.application->save();
     bob.pass();
@@ -117,10 +119,8 @@ TEST_F(TwoWriters, AGroupThatAWriterDeletedIsGoneWhateverItsOwnerChangesInIt) {
 }
 
 TEST_F(TwoWriters, AGroupThatItsOwnerDeletedIsGoneWhateverAWriterHasChangedInIt) {
-    const CXGroupRef circle = alice.group("Circle", {people[0]});
+    const CXGroupRef circle = circleOfBoth();
     const UniqueId uid = circle->uniqueId();
-    alice.pass();
-    bob.pass();
     copyOf(circle)->addMember(bob.copyOf(people[1]));
     copyOf(circle)->setValue(Value("Bob's circle"), kCXGroupNameProperty);
     bob.application->save();
@@ -131,10 +131,8 @@ TEST_F(TwoWriters, AGroupThatItsOwnerDeletedIsGoneWhateverAWriterHasChangedInIt)
 }
 
 TEST_F(TwoWriters, AGroupThatAWriterDeletesIsGoneWhateverItsOwnerHasChangedInIt) {
-    const CXGroupRef circle = alice.group("Circle", {people[0]});
+    const CXGroupRef circle = circleOfBoth();
     const UniqueId uid = circle->uniqueId();
-    alice.pass();
-    bob.pass();
     circle->addMember(people[1]);
     alice.application->save();
     alice.pass();
@@ -145,10 +143,8 @@ TEST_F(TwoWriters, AGroupThatAWriterDeletesIsGoneWhateverItsOwnerHasChangedInIt)
 
 // The owner's change is written without a look at what else is new on the store, as after each save.
 TEST_F(TwoWriters, AnOwnersChangeDoesNotMakeAPartOfAGroupThatAWriterDeletedInTheMeantime) {
-    const CXGroupRef circle = alice.group("Circle", {people[0]});
+    const CXGroupRef circle = circleOfBoth();
     const UniqueId uid = circle->uniqueId();
-    alice.pass();
-    bob.pass();
     std::filesystem::remove(world->file(uid.str()));
     auto change =
         std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, CXDAddRecordToGroup, kSelf, people[1]->uniqueId(), uid);
@@ -180,6 +176,29 @@ TEST_F(TwoWriters, AContactThatIsDeletedHereWhileAnEditOfItArrivesStaysDeletedAn
     for (Participant* each : {&bob, &alice, &bob, &alice}) each->pass();
     EXPECT_FALSE(alice.application->recordForUniqueId(uid)) << log.text();
     EXPECT_FALSE(std::filesystem::exists(fileOf(uid)));
+    EXPECT_EQ(copies(), alice.view());
+    for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
+}
+
+// The deletion waits, and the contact that is still there has been changed meanwhile.
+TEST_F(TwoWriters, AContactWhoseDeletionWaitsDoesNotComeBackWithSomebodysEdit) {
+    bob.pass();
+    const UniqueId uid = people[0]->uniqueId(), copy = bob.copyOf(people[0])->uniqueId();
+    people[0]->setValue(Value("Adah"), kCXFirstNameProperty);
+    alice.application->save();
+    alice.pass();
+    bob.application->removeRecord(bob.copyOf(people[0]));
+    bob.application->save();
+    std::atomic<bool> fails = true;
+    bob.wire->intercept([&](const HttpRequest& request) {
+        return fails && request.method == "DELETE" ? std::optional(answerOf(503)) : std::nullopt;
+    });
+    bob.pass();
+    EXPECT_EQ(bob.engine->getPendingChanges().size(), 1u) << log.text();
+    EXPECT_FALSE(bob.application->recordForUniqueId(copy)) << log.text();
+    fails = false;
+    for (Participant* each : {&bob, &alice, &bob, &alice}) each->pass();
+    EXPECT_FALSE(alice.application->recordForUniqueId(uid)) << log.text();
     EXPECT_EQ(copies(), alice.view());
     for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
 }

@@ -1,7 +1,7 @@
 #include "store/EarlyReads.h"
 
+#include "ManyContacts.h"
 #include "RecordingTransport.h"
-#include "StoreWorld.h"
 #include "support/FakeHttpServer.h"
 
 #include <algorithm>
@@ -201,36 +201,7 @@ TEST(EarlyReads, WhatGivesWayGoesBehindWhatSomebodyWaitsFor) {
 
 namespace {
 
-struct ReadingEarly : testing::Test {
-    static void SetUpTestSuite() { world = new StoreWorld; }
-    static void TearDownTestSuite() {
-        delete world;
-        world = nullptr;
-    }
-    ReadingEarly() {
-        client.manager.sanityCheckPublishStructureCreate(true);
-        for (int i = 0; i < 300; ++i) client.write(name(i), Dictionary{{"number", i}});
-        client.wire->clear();
-    }
-    static std::string name(int i) {
-        return "People/" + std::to_string(i % 32) + "/" + std::to_string(i) + ":CXPerson";
-    }
-    std::vector<Url> all() const {
-        std::vector<Url> urls;
-        for (int i = 0; i < 300; ++i) urls.push_back(client.at(name(i)));
-        return urls;
-    }
-    void readAll() {
-        for (int i = 0; i < 300; ++i) {
-            const auto content = client.manager.dictionaryAtURL(client.at(name(i)), true, nullptr);
-            ASSERT_TRUE(content) << i;
-            EXPECT_EQ((*content)["number"], Value(i));
-        }
-    }
-    static StoreWorld* world;
-    Client client{*world};
-};
-StoreWorld* ReadingEarly::world = nullptr;
+struct ReadingEarly : ManyContacts<ReadingEarly> {};
 
 } // namespace
 

@@ -1,7 +1,7 @@
 #include "store/ReadAhead.h"
 
+#include "ManyContacts.h"
 #include "RecordingTransport.h"
-#include "StoreWorld.h"
 
 #include <gtest/gtest.h>
 #include <thread>
@@ -137,39 +137,13 @@ TEST(ReadAhead, AnswersThatComeAfterTheEndHarmNobody) {
 
 namespace {
 
-struct ReadingAhead : testing::Test {
-    static void SetUpTestSuite() { world = new StoreWorld; }
-    static void TearDownTestSuite() {
-        delete world;
-        world = nullptr;
-    }
-    ReadingAhead() {
-        client.manager.sanityCheckPublishStructureCreate(true);
-        for (int i = 0; i < 300; ++i) client.write(name(i), Dictionary{{"number", i}});
-        client.wire->clear();
-    }
-    static std::string name(int i) {
-        return "People/" + std::to_string(i % 32) + "/" + std::to_string(i) + ":CXPerson";
-    }
-    std::vector<Url> all() const {
-        std::vector<Url> urls;
-        for (int i = 0; i < 300; ++i) urls.push_back(client.at(name(i)));
-        return urls;
-    }
-    static StoreWorld* world;
-    Client client{*world};
-};
-StoreWorld* ReadingAhead::world = nullptr;
+struct ReadingAhead : ManyContacts<ReadingAhead> {};
 
 } // namespace
 
 TEST_F(ReadingAhead, EveryExpectedFileIsFetchedOnceAndASecondReadGoesToTheStore) {
     client.manager.expectReads(all(), true);
-    for (int i = 0; i < 300; ++i) {
-        const auto content = client.manager.dictionaryAtURL(client.at(name(i)), true, nullptr);
-        ASSERT_TRUE(content) << i;
-        EXPECT_EQ((*content)["number"], Value(i));
-    }
+    readAll();
     EXPECT_EQ(client.wire->count("GET"), 300u);
     EXPECT_TRUE(client.manager.dictionaryAtURL(client.at(name(7)), true, nullptr));
     EXPECT_EQ(client.wire->count("GET"), 301u);
