@@ -17,6 +17,7 @@
 #include "store/CXDAVManager.h"
 #include "store/CXNetworkController.h"
 
+#include <set>
 #include <utility>
 
 namespace rolvane {
@@ -325,15 +326,22 @@ CXDChangeRecords CXDVaultraConduit::changeRecords() {
     return records;
 }
 
-// A contact that no list names is about to be added, and comes when it is listed; or it has been deleted and was
-// written once more by somebody who did not know. Whoever knows it reads what is written. Nobody else takes it in: it
-// would stay behind when its file goes. From the own tree it is taken away.
+// A contact that the list of everybody does not name and that joins no group is about to be added, and comes when it is
+// listed; or it has been deleted and was written once more by somebody who did not know. Whoever knows it reads what is
+// written. Nobody else takes it in: it would stay behind when its file goes. From the own tree it is taken away.
+// (Where single groups are published, the list of everybody does not name all who have joined one since.)
 void CXDVaultraConduit::leaveUnlistedOut(CXDChangeRecords& records) {
     std::map<UserName, ListedContacts> lists;
+    std::set<std::pair<UserName, UniqueId>> joining;
+    for (const CXDChangeRecordPtr& record : records)
+        if (record->type() == CXDAddRecordToGroup && record->person() && record->user() &&
+            _read.contains(*record->user()))
+            joining.emplace(*record->user(), *record->person());
     std::erase_if(records, [&](const CXDChangeRecordPtr& record) {
         if (record->type() != CXDUpdateRecord || !record->person() || !record->user()) return false;
         const auto read = _read.find(*record->user());
         if (read == _read.end()) return false;
+        if (joining.contains({*record->user(), *record->person()})) return false;
         const UniqueId shared = cxNormalizedUID(*record->person());
         if (lists.try_emplace(*record->user(), read->second).first->second.contains(shared)) return false;
         if (_world.rolvane.recordForUniqueId(*record->person())) return false;
@@ -472,6 +480,7 @@ bool CXDVaultraConduit::wasDeletedThere(CXDChangeRecord& record) {
     int code = 0;
     const Url location = layout::groupLocation(*baseLocationOf(record), *record.group());
     if (_world.manager.dictionaryAtURL(location, false, &code) || code != kMissing) return false;
+    if (record.group()->str() == layout::kAllGroup) return true; // it will be seen that the tree has lost its lists
     CXLog("The group has been deleted by somebody else, and is not changed any more: %@", record.description());
     engine().noteRefused({*record.user(), kRefusedAsGroupIsGone, known[kCXGroupNameProperty].string()});
     return true;

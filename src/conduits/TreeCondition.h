@@ -57,8 +57,7 @@ CXDChangeRecordPtr removalOfContact(const UniqueId& person);
 // none is missing and none is there besides.
 std::vector<UniqueId> contactsThatAreMissing(const Dictionary& current);
 
-// The contacts that the list of everybody names, to be asked for many. Where single groups are published, it names who
-// is in them.
+// The contacts that the list of everybody names, to be asked for many.
 class ListedContacts {
 public:
     explicit ListedContacts(const Dictionary& current);

@@ -233,6 +233,25 @@ TEST_F(TwoWriters, AContactsFileThatTheStoreHasLostIsWrittenAgainByItsOwner) {
     for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
 }
 
+TEST_F(TwoWriters, WhoJoinsASingleGroupThatIsPublishedArrives) {
+    CXMutableMultiValue locations;
+    locations.addValue(alice.base, kCXPublishLabel);
+    alice.application->allGroup()->setValue(CXMultiValue(), kCXRemoteLocationProperty);
+    const CXGroupRef circle = alice.group("Circle", {people[0]});
+    circle->setValue(locations, kCXRemoteLocationProperty);
+    alice.application->save();
+    std::filesystem::remove_all(world->file());
+    for (int pass = 0; pass < 3; ++pass) alice.pass(); // the tree is lost, and published again
+    bob.pass();
+    const CXPersonRef dora = alice.add("Dora");
+    circle->addMember(dora);
+    alice.application->save();
+    alice.pass();
+    bob.pass();
+    ASSERT_TRUE(bob.copyOf(dora)) << log.text();
+    EXPECT_EQ(firstName(bob.copyOf(dora)), Value("Dora"));
+}
+
 TEST_F(TwoWriters, AContactsFileIsNotWrittenAgainWhereNotEverybodyIsPublished) {
     CXMutableMultiValue locations;
     locations.addValue(alice.base, kCXPublishLabel);
