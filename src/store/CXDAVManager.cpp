@@ -87,6 +87,10 @@ HttpTransport& CXDAVManager::transport() {
     return _impl->session.transport();
 }
 
+RequestFailures& CXDAVManager::failures() {
+    return _impl->session.failures();
+}
+
 // ---- the process's own
 
 static std::shared_ptr<CXDAVManager> shared() {

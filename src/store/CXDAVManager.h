@@ -8,6 +8,7 @@
 #include "store/Account.h"
 #include "store/CXFileManager.h"
 #include "store/HttpTransport.h"
+#include "store/RequestFailures.h"
 
 #include <memory>
 #include <optional>
@@ -80,6 +81,8 @@ public:
     bool canReach(CXDAVError& error, const std::function<void()>& meanwhile = {});
     const CXDAVAccount& account() const;
     HttpTransport& transport();
+    // The requests whose answers made an operation fail. A 404 to the question whether something is there is none.
+    RequestFailures& failures();
 
     // -- files
     bool write(const std::string& text, const Url& url, bool securely) override;

@@ -12,9 +12,8 @@ namespace {
 constexpr size_t kAnswerBytes = 8u << 20;
 
 // What a server says that does not serve this depth; a refused login or an absent resource is no such answer.
-bool refusesTheDepth(const HttpResponse& answer) {
-    return answer.error == TransportError::tooLarge || answer.status == 400 || answer.status == 403 ||
-           answer.status == 405 || answer.status == 501 || answer.status == 507;
+bool refusesTheDepth(int status) {
+    return status == 400 || status == 403 || status == 405 || status == 501 || status == 507;
 }
 
 } // namespace
@@ -31,9 +30,9 @@ std::optional<CXDAVNode> CXDAVQuery::ask(int depth) {
     if (!_agent.empty()) request.headers.emplace_back("User-Agent", _agent);
     request.body = std::make_shared<const std::string>(_body);
     request.limits.maxBodyBytes = kAnswerBytes;
-    const HttpResponse answer = session.send(std::move(request));
+    const HttpResponse answer = session.send(std::move(request), depth == kUnboundedDepth ? refusesTheDepth : nullptr);
     _status = answer.status;
-    _refused = refusesTheDepth(answer);
+    _refused = answer.error == TransportError::tooLarge || refusesTheDepth(answer.status);
     if (!answer.complete() || answer.status != 207) return std::nullopt;
     return parseDAVTree(answer.body);
 }

@@ -52,15 +52,6 @@ TransportError translated(CURLcode code) {
     }
 }
 
-// Retry-After (RFC 9110 section 10.2.3) in seconds from now; nothing when there is none or it makes no sense.
-std::optional<double> retryAfterSeconds(const HttpResponse& answer) {
-    const std::string* text = answer.header("retry-after");
-    if (!text || text->empty()) return std::nullopt;
-    if (text->find_first_not_of("0123456789") == std::string::npos) return std::min(1e6, atof(text->c_str()));
-    if (auto date = Date::fromHTTP(*text)) return std::max(0.0, date->secondsSince(Clock::system().now()));
-    return std::nullopt;
-}
-
 // True when the answer asks for Digest and does not take Basic.
 bool wantsDigest(const HttpResponse& answer) {
     bool digest = false;
@@ -418,7 +409,7 @@ bool CurlTransport::Impl::sendAgain(std::unique_ptr<HttpJob>& job) {
         if (!automatic || job->repetitions > 0 || !wantsDigest(job->response)) return false;
         digestOrigins.insert(job->origin);
     } else if (status == 503 || status == 429) {
-        const auto seconds = retryAfterSeconds(job->response);
+        const auto seconds = retryAfterSeconds(job->response, Clock::system().now());
         if (!seconds) return false;
         const SteadyTime until = Steady::now() + inSeconds(std::min(*seconds, options.maxRetryAfterSeconds));
         notBefore = std::max(notBefore, until);

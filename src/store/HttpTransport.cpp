@@ -1,6 +1,8 @@
 #include "store/HttpTransport.h"
 
+#include <algorithm>
 #include <condition_variable>
+#include <cstdlib>
 #include <mutex>
 
 namespace rolvane {
@@ -23,6 +25,15 @@ const std::string* HttpResponse::header(std::string_view lowerCaseName) const {
     for (const auto& [name, value] : headers)
         if (name == lowerCaseName) return &value;
     return nullptr;
+}
+
+std::optional<double> retryAfterSeconds(const HttpResponse& answer, const Date& now) {
+    constexpr double kLongest = 1e6;
+    const std::string* text = answer.header("retry-after");
+    if (!text || text->empty()) return std::nullopt;
+    if (text->find_first_not_of("0123456789") == std::string::npos) return std::min(kLongest, atof(text->c_str()));
+    if (const auto date = Date::fromHTTP(*text)) return std::clamp(date->secondsSince(now), 0.0, kLongest);
+    return std::nullopt;
 }
 
 std::vector<HttpResponse> HttpTransport::performAll(std::vector<HttpRequest> requests) {

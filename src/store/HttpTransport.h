@@ -1,5 +1,6 @@
 #pragma once
 
+#include "foundation/Date.h"
 #include "foundation/Url.h"
 
 #include <atomic>
@@ -59,6 +60,9 @@ struct HttpResponse {
     bool ok() const { return complete() && status >= 200 && status < 300 && status != 207; } // what counts as success
     const std::string* header(std::string_view lowerCaseName) const; // the first of that name, or none
 };
+// Retry-After (RFC 9110 section 10.2.3) in seconds from `now`, at most 1,000,000; nothing when there is none or it
+// makes no sense.
+std::optional<double> retryAfterSeconds(const HttpResponse& answer, const Date& now);
 
 // Sends requests to the network store. Exists so that tests can inject faults. Any thread; nothing throws but
 // std::bad_alloc. Redirects are never followed: a 3xx is an answer like any other.

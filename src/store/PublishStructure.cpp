@@ -102,7 +102,7 @@ bool PublishStructure::makeTree() {
     for (Url u = bytes.cxURLByDeletingLastComponent(); !u.cxLastComponent().empty();
          u = u.cxURLByDeletingLastComponent())
         above.insert(above.begin(), u);
-    for (const Url& u : above) _session.send(StoreSession::request("MKCOL", u));
+    for (const Url& u : above) _session.send(StoreSession::request("MKCOL", u), [](int) { return true; });
     return _files.makeCollection(tree);
 }
 
@@ -123,10 +123,10 @@ HttpRequest PublishStructure::writingNew(const Url& name, const std::string& tex
 
 // All at once. What exists already (405 and 412), because somebody else makes the structure too, is as good.
 bool PublishStructure::makeAll(std::vector<HttpRequest> requests) {
-    const auto answers = _session.sendAll(std::move(requests));
-    return std::all_of(answers.begin(), answers.end(), [](const HttpResponse& answer) {
-        return answer.ok() || answer.status == 405 || answer.status == 412;
-    });
+    const auto isThere = [](int status) { return status == 405 || status == 412; };
+    const auto answers = _session.sendAll(std::move(requests), isThere);
+    return std::all_of(answers.begin(), answers.end(),
+                       [&](const HttpResponse& answer) { return answer.ok() || isThere(answer.status); });
 }
 
 bool PublishStructure::complete(const Missing& missing) {

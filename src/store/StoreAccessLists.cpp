@@ -172,7 +172,7 @@ HttpResponse StoreAccessLists::send(OnStore& found, const AccessLists& wanted) {
     HttpRequest request = StoreSession::request("ACL", found.asked);
     request.headers = {{"Content-Type", "application/xml; charset=utf-8"}};
     request.body = std::make_shared<const std::string>(std::move(body));
-    return _session.send(std::move(request));
+    return _session.send(std::move(request), [](int) { return true; });
 }
 
 bool StoreAccessLists::sendOrInherit(const Url& name, OnStore& found, const AccessLists& wanted) {
@@ -180,6 +180,7 @@ bool StoreAccessLists::sendOrInherit(const Url& name, OnStore& found, const Acce
     if (answer.status == 403 && !found.inheritedFrom.empty())
         if (auto parent = fetchParent(found)) answer = send(*parent, wanted);
     if (answer.ok()) return true;
+    _session.noteFailure("ACL", found.asked, answer);
     CXLog("The access list of %@ could not be set: %@", name,
           answer.complete() ? std::to_string(answer.status) + ", " + reasonIn(answer) : answer.detail);
     return false;

@@ -83,6 +83,23 @@ std::vector<std::pair<std::string, std::string>> conditions(const ReadMark& mark
     return out;
 }
 
+// What callers handle.
+bool isAbsence(int status) {
+    return status == 404;
+}
+bool isAbsenceOrDenial(int status) {
+    return status == 404 || status == 403;
+}
+bool mayMeanACollection(int status) {
+    return isAbsenceOrDenial(status) || status == 405 || (status >= 300 && status < 400);
+}
+bool isInTheWay(int status) {
+    return status == 405 || status == 409 || (status >= 300 && status < 400);
+}
+bool isAny(int) {
+    return true;
+}
+
 std::string contentType(const std::string& text) {
     return text.starts_with("<?xml") ? "application/xml; charset=utf-8" : "text/plain; charset=utf-8";
 }
@@ -122,11 +139,12 @@ void StoreFiles::forget(const Url& url) {
 StoreFiles::Fetched StoreFiles::fetch(const Url& url, bool mayBeCollection) {
     std::optional<HttpResponse> waiting = _early.take(url);
     if (!waiting) waiting = _ahead.take(url);
-    HttpResponse answer =
-        waiting ? _session.judged(std::move(*waiting)) : _session.send(StoreSession::request("GET", url));
+    const StoreSession::Handled handled = mayBeCollection ? mayMeanACollection : isAbsenceOrDenial;
+    HttpResponse answer = waiting ? _session.judged("GET", url, std::move(*waiting), handled)
+                                  : _session.send(StoreSession::request("GET", url), handled);
     // httpd says 403 of a file that is replaced or removed while it is being opened, too: only what is said twice
     // counts.
-    if (answer.status == 403 && !mayBeCollection) answer = _session.send(StoreSession::request("GET", url));
+    if (answer.status == 403 && !mayBeCollection) answer = _session.send(StoreSession::request("GET", url), isAbsence);
     Fetched out;
     out.code = answer.status;
     if (!answer.complete()) return out;
@@ -265,12 +283,12 @@ std::optional<Date> StoreFiles::modificationDate(const Url& name) {
     const auto url = _session.endpoint(name);
     if (!url) return std::nullopt;
     const Url target = mayBeBoth(name) && knownCollection(*url) ? stateURL(*url) : *url;
-    const HttpResponse answer = _session.send(StoreSession::request("HEAD", target));
+    const HttpResponse answer = _session.send(StoreSession::request("HEAD", target), isAny);
     if (answer.ok())
         if (const std::string* date = answer.header("last-modified")) return Date::fromHTTP(*date);
     if (!answer.complete() || answer.status == 404) return std::nullopt;
     MultistatusReader reader;
-    const HttpResponse found = _session.send(StoreSession::propfind(target, 0));
+    const HttpResponse found = _session.send(StoreSession::propfind(target, 0), isAbsence);
     if (found.status != 207 || !reader.feed(found.body)) return std::nullopt;
     const auto entries = reader.finish();
     return entries && entries->size() == 1 ? entries->front().lastModified : std::nullopt;
@@ -287,13 +305,13 @@ void StoreFiles::keepWritten(const Url& name, const std::string& text) {
     }
 }
 
-int StoreFiles::put(const Url& name, const Url& target, const std::shared_ptr<const std::string>& body,
-                    std::vector<std::pair<std::string, std::string>> headers) {
+HttpResponse StoreFiles::put(const Url& name, const Url& target, const std::shared_ptr<const std::string>& body,
+                             std::vector<std::pair<std::string, std::string>> headers) {
     HttpRequest request = StoreSession::request("PUT", target);
     headers.emplace_back("Content-Type", contentType(*body));
     request.headers = std::move(headers);
     request.body = body;
-    const HttpResponse answer = _session.send(std::move(request));
+    HttpResponse answer = _session.send(std::move(request), isAny);
     _early.forget(target);
     _ahead.forget(target);
     if (answer.ok()) {
@@ -303,7 +321,7 @@ int StoreFiles::put(const Url& name, const Url& target, const std::shared_ptr<co
                         date ? Date::fromHTTP(*date) : std::nullopt, *body);
         if (mayBeBoth(name)) keepWritten(name, *body);
     }
-    return answer.status;
+    return answer;
 }
 
 int StoreFiles::write(const Url& name, std::string text, bool securely, const std::function<bool()>& repair) {
@@ -315,22 +333,28 @@ int StoreFiles::write(const Url& name, std::string text, bool securely, const st
     const Url state = both ? stateURL(*url) : Url();
     const Url first = both && knownCollection(*url) ? state : *url;
     const auto body = std::make_shared<const std::string>(std::move(text));
+    HttpResponse answer;
     const auto attempt = [&](const Url& target) {
-        return put(name, target, body, conditions(mark, _tokens.tokenFor(target.absoluteString()), target));
+        answer = put(name, target, body, conditions(mark, _tokens.tokenFor(target.absoluteString()), target));
+        return answer.status;
+    };
+    const auto last = [&](int status) {
+        if (!succeeded(status)) _session.noteFailure("PUT", *url, answer);
+        return status;
     };
     const int code = attempt(first);
-    if (succeeded(code) || code == 0) return code;
+    if (succeeded(code) || code == 0) return last(code);
     if (both && first == state && (code == 409 || code == 404 || code == 400)) { // the collection is gone
         forget(*url);
-        return attempt(*url);
+        return last(attempt(*url));
     }
     const bool mayBeInTheWay = code == 409 || code == 405 || code == 412 || (code >= 300 && code < 400);
     if (both && first == *url && mayBeInTheWay && kindOf(*url) == Kind::collection) {
         remember(*url);
-        return attempt(state);
+        return last(attempt(state));
     }
-    if ((code == 409 || code == 404) && repair && repair()) return attempt(first);
-    return code;
+    if ((code == 409 || code == 404) && repair && repair()) return last(attempt(first));
+    return last(code);
 }
 
 int StoreFiles::remove(const Url& name) {
@@ -344,13 +368,13 @@ int StoreFiles::remove(const Url& name) {
     HttpRequest request = StoreSession::request("DELETE", *url);
     const LockToken token = _tokens.tokenFor(url->absoluteString());
     if (!token.empty()) request.headers.emplace_back("If", taggedCondition(*url, "<" + token.str() + ">"));
-    return _session.send(std::move(request)).status;
+    return _session.send(std::move(request), isAbsence).status;
 }
 
 // ---- collections
 
 StoreFiles::Kind StoreFiles::kindOf(const Url& url, EntityTag* tag) {
-    const HttpResponse answer = _session.send(StoreSession::propfind(url, 0));
+    const HttpResponse answer = _session.send(StoreSession::propfind(url, 0), isAbsence);
     if (answer.status == 404) return Kind::absent;
     MultistatusReader reader;
     if (answer.status != 207 || !reader.feed(answer.body)) return Kind::unknown;
@@ -363,17 +387,20 @@ StoreFiles::Kind StoreFiles::kindOf(const Url& url, EntityTag* tag) {
 bool StoreFiles::makeCollection(const Url& name) {
     const auto url = _session.endpoint(name);
     if (!url) return false;
-    const HttpResponse answer = _session.send(StoreSession::request("MKCOL", *url));
+    const HttpResponse answer = _session.send(StoreSession::request("MKCOL", *url), isInTheWay);
     if (answer.status == 405 && knownCollection(*url)) return true;
     if (answer.ok()) {
         remember(*url);
         return true;
     }
-    if (answer.status != 405 && answer.status != 409 && (answer.status < 300 || answer.status >= 400)) return false;
+    if (!isInTheWay(answer.status)) return false;
     EntityTag tag;
     const Kind kind = kindOf(*url, &tag);
     if (kind == Kind::file && !moveIntoCollection(*url, tag)) return false;
-    if (kind != Kind::collection && kind != Kind::file) return false;
+    if (kind != Kind::collection && kind != Kind::file) {
+        _session.noteFailure("MKCOL", *url, answer);
+        return false;
+    }
     remember(*url);
     return true;
 }
@@ -383,7 +410,7 @@ bool StoreFiles::makeCollection(const Url& name) {
 bool StoreFiles::moveIntoCollection(const Url& url, const EntityTag& tag) {
     const Url making = url.cxURLByDeletingLastComponent().cxURLByAppendingComponent(url.cxLastComponent() +
                                                                                     std::string(kMakingSuffix));
-    const HttpResponse made = _session.send(StoreSession::request("MKCOL", making));
+    const HttpResponse made = _session.send(StoreSession::request("MKCOL", making), isInTheWay);
     if (!made.ok() && made.status != 405) return false;
     HttpRequest copy = StoreSession::request("COPY", url);
     copy.headers = {{"Destination", stateURL(making).absoluteString()}, {"Overwrite", "T"}, {"Depth", "0"}};

@@ -66,8 +66,8 @@ private:
     void note(const Url& name, const Url& target, const Fetched& fetched);
 
     void keepWritten(const Url& name, const std::string& text);
-    int put(const Url& name, const Url& target, const std::shared_ptr<const std::string>& body,
-            std::vector<std::pair<std::string, std::string>> headers);
+    HttpResponse put(const Url& name, const Url& target, const std::shared_ptr<const std::string>& body,
+                     std::vector<std::pair<std::string, std::string>> headers);
     enum class Kind { absent, file, collection, unknown };
     Kind kindOf(const Url& url, EntityTag* tag = nullptr);
     bool moveIntoCollection(const Url& url, const EntityTag& tag); // `tag`: the file's; empty when the store gives none

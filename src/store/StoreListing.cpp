@@ -94,14 +94,16 @@ StoreListing::AskedRef StoreListing::ask(const std::vector<Url>& containers, con
 
 StoreListing::Members StoreListing::read(Asked& asked, size_t number) {
     Members out;
-    const HttpResponse answer = _session.judged(std::move(asked.answers[number]));
+    const Url place = *_session.endpoint(asked.containers[number]);
+    const HttpResponse answer =
+        _session.judged("PROPFIND", place, std::move(asked.answers[number]), [](int status) { return status == 404; });
     const auto staged = std::move(asked.staged[number]);
     out.code = answer.status;
     out.serverDate = serverDateOf(answer);
     if (answer.status != 207 || !staged->sound) return out;
     const auto entries = staged->reader.finish();
     if (!entries || entries->empty()) return out; // even an empty container names itself
-    const Url container = *_session.nameFor(_session.endpoint(asked.containers[number])->absoluteString());
+    const Url container = *_session.nameFor(place.absoluteString());
     std::vector<std::pair<Url, MultistatusEntry>> inside;
     bool namesItself = false, whole = true;
     for (const MultistatusEntry& entry : *entries) {
@@ -172,7 +174,7 @@ bool StoreListing::addStates(const std::vector<Url>& groups, FileListing& out) {
     for (const Url& group : groups)
         requests.push_back(
             StoreSession::propfind(_session.endpoint(group)->cxURLByAppendingComponent(CXDAVManager::kStateName), 0));
-    const auto answers = _session.sendAll(std::move(requests));
+    const auto answers = _session.sendAll(std::move(requests), [](int status) { return status == 404; });
     for (size_t i = 0; i < answers.size(); ++i) {
         if (answers[i].status == 404) continue;
         MultistatusReader reader;

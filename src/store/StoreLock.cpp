@@ -37,9 +37,13 @@ LockToken tokenInHeader(const HttpResponse& answer) {
 
 // True when the store has said that it knows the lock no more. A server in trouble, a refusal or somebody else's answer
 // says nothing of it.
-bool isGone(const HttpResponse& answer) {
-    const int status = answer.complete() ? answer.status : 0;
+bool isGone(int status) {
     return status == 404 || status == 409 || status == 410 || status == 412;
+}
+
+// Who may not lock needs no lock, see tryLock.
+bool isDenied(int status) {
+    return status == 403;
 }
 
 double secondsSinceBoot() {
@@ -63,9 +67,9 @@ StandingLock lockThere(StoreSession& session, const Url& endpoint, const LockLed
     r.headers = {{"Depth", "0"}, {"Content-Type", "application/xml; charset=utf-8"}};
     r.body = std::make_shared<const std::string>("<?xml version=\"1.0\" encoding=\"utf-8\"?>\n<propfind xmlns=\"DAV:\">"
                                                  "<prop><lockdiscovery/></prop></propfind>");
-    const HttpResponse answer = session.send(std::move(r));
+    const HttpResponse answer = session.send(std::move(r), isGone);
     if (!answer.complete()) return {};
-    if (answer.status != 207) return {isGone(answer) || answer.status == 403, std::nullopt};
+    if (answer.status != 207) return {isGone(answer.status) || answer.status == 403, std::nullopt};
     const auto lock = parseLockAnswer(answer.body);
     return {true, lock && ledger.isAnEndedRun(lock->owner) ? std::optional(lock->token) : std::nullopt};
 }
@@ -74,8 +78,8 @@ StandingLock lockThere(StoreSession& session, const Url& endpoint, const LockLed
 bool release(StoreSession& session, const Url& endpoint, const LockToken& token) {
     HttpRequest r = StoreSession::request("UNLOCK", endpoint);
     r.headers = {{"Lock-Token", "<" + token.str() + ">"}};
-    const HttpResponse answer = session.send(std::move(r));
-    return answer.ok() || isGone(answer);
+    const HttpResponse answer = session.send(std::move(r), isGone);
+    return answer.ok() || isGone(answer.status);
 }
 
 } // namespace
@@ -100,7 +104,7 @@ HttpResponse StoreLock::ask(const LockToken& refreshed) {
             "<locktype><write/></locktype><owner>" +
             escaped(ownerOf(client->session.account().user, _ledger.markOfThisRun())) + "</owner></lockinfo>");
     }
-    return client->session.send(std::move(r));
+    return client->session.send(std::move(r), isDenied);
 }
 
 // Keeps what the answer grants; false when it grants nothing.
@@ -184,7 +188,7 @@ bool StoreLock::renew() {
     if (token.empty()) return false;
     const HttpResponse answer = ask(token);
     if (take(answer, token)) return true;
-    lose(isGone(answer));
+    lose(isGone(answer.status));
     return false;
 }
 

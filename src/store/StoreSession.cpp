@@ -41,6 +41,14 @@ const std::shared_ptr<const std::string>& propfindBody(bool withMembersTags) {
     return withMembersTags ? tags : plain;
 }
 
+// The answer to a request that has no password to go with.
+HttpResponse unsent() {
+    HttpResponse answer;
+    answer.error = TransportError::refused;
+    answer.detail = "The password of the account cannot be had.";
+    return answer;
+}
+
 } // namespace
 
 bool announcesDavClass(const HttpResponse& answer, std::string_view wanted) {
@@ -125,7 +133,7 @@ bool StoreSession::signIn() {
     return true;
 }
 
-HttpResponse StoreSession::judged(HttpResponse answer) {
+HttpResponse StoreSession::believed(HttpResponse answer) {
     if (answer.status == 401) {
         std::lock_guard guard(_mutex);
         _loginRefused = true;
@@ -140,32 +148,36 @@ HttpResponse StoreSession::judged(HttpResponse answer) {
     return answer;
 }
 
-HttpResponse StoreSession::send(HttpRequest request) {
-    if (!signIn()) {
-        HttpResponse unsent;
-        unsent.error = TransportError::refused;
-        unsent.detail = "The password of the account cannot be had.";
-        return unsent;
-    }
-    return judged(_transport->perform(std::move(request)));
+HttpResponse StoreSession::judged(std::string_view method, const Url& url, HttpResponse answer, Handled handled) {
+    HttpResponse heeded = believed(std::move(answer));
+    const bool succeeded = heeded.ok() || (heeded.status == 207 && method == "PROPFIND");
+    if (!succeeded && !(heeded.complete() && handled && handled(heeded.status))) noteFailure(method, url, heeded);
+    return heeded;
 }
 
-std::vector<HttpResponse> StoreSession::sendAll(std::vector<HttpRequest> requests) {
-    if (!signIn()) {
-        HttpResponse unsent;
-        unsent.error = TransportError::refused;
-        return std::vector<HttpResponse>(requests.size(), unsent);
-    }
-    auto answers = _transport->performAll(std::move(requests));
-    for (auto& a : answers) a = judged(std::move(a));
+void StoreSession::noteFailure(std::string_view method, const Url& url, const HttpResponse& answer) {
+    _failures.note(std::string(method), nameFor(url.absoluteString()).value_or(url), answer);
+}
+
+HttpResponse StoreSession::send(HttpRequest request, Handled handled) {
+    const std::string method = request.method;
+    const Url url = request.url;
+    return judged(method, url, signIn() ? _transport->perform(std::move(request)) : unsent(), handled);
+}
+
+std::vector<HttpResponse> StoreSession::sendAll(std::vector<HttpRequest> requests, Handled handled) {
+    std::vector<std::pair<std::string, Url>> asked;
+    for (const HttpRequest& request : requests) asked.emplace_back(request.method, request.url);
+    auto answers =
+        signIn() ? _transport->performAll(std::move(requests)) : std::vector<HttpResponse>(requests.size(), unsent());
+    for (size_t i = 0; i < answers.size(); ++i)
+        answers[i] = judged(asked[i].first, asked[i].second, std::move(answers[i]), handled);
     return answers;
 }
 
 void StoreSession::start(HttpRequest request, HttpTransport::Completion done) {
     if (signIn()) return _transport->start(std::move(request), std::move(done));
-    HttpResponse unsent;
-    unsent.error = TransportError::refused;
-    done(std::move(unsent));
+    done(unsent());
 }
 
 HttpResponse StoreSession::options() {
@@ -245,7 +257,9 @@ bool StoreSession::canReach(CXDAVError& error, const std::function<void()>& mean
     for (size_t i = 0; i < answers.size(); ++i) {
         const HttpResponse& answer = answers[i];
         if (answer.complete() && answer.status != 401 && _davSeen != 0) continue;
-        error = errorFrom(answer, i == 0 ? "OPTIONS" : "PROPFIND");
+        const char* asked = i == 0 ? "OPTIONS" : "PROPFIND";
+        error = errorFrom(answer, asked);
+        noteFailure(asked, endpoint(_account.baseLocationFor(_account.user)).value_or(Url()), answer);
         std::lock_guard guard(_mutex);
         _loginRefused = _loginRefused || answer.status == 401;
         return false;

@@ -3,6 +3,7 @@
 #include "store/Account.h"
 #include "store/CXDAVManager.h"
 #include "store/HttpTransport.h"
+#include "store/RequestFailures.h"
 
 #include <atomic>
 #include <chrono>
@@ -32,12 +33,19 @@ public:
     // The name of an href, or nothing; both as CXDAVAccount's.
     std::optional<Url> nameFor(std::string_view href) const { return _map.nameFor(href); }
 
+    // Which statuses, besides success, the caller handles: those answers are no failures of its operation.
+    using Handled = bool (*)(int status);
+
     // Sends the request. A 403 or 404 is believed only from a WebDAV server: otherwise the answer is an `unreachable`.
-    HttpResponse send(HttpRequest request);
-    std::vector<HttpResponse> sendAll(std::vector<HttpRequest> requests);
+    // An answer that is neither success nor handled is noted among the failures.
+    HttpResponse send(HttpRequest request, Handled handled = nullptr);
+    std::vector<HttpResponse> sendAll(std::vector<HttpRequest> requests, Handled handled = nullptr);
     // Sends it and calls back with the answer as it came; whoever uses that has it judged then, on its own thread.
     void start(HttpRequest request, HttpTransport::Completion done);
-    HttpResponse judged(HttpResponse answer);
+    HttpResponse judged(std::string_view method, const Url& url, HttpResponse answer, Handled handled = nullptr);
+    // An answer that was handled, and still made the caller's operation fail.
+    void noteFailure(std::string_view method, const Url& url, const HttpResponse& answer);
+    RequestFailures& failures() { return _failures; }
 
     // Whether the store can be used, see CXDAVManager::canReachOstrelError.
     bool canReach(CXDAVError& error, const std::function<void()>& meanwhile = {});
@@ -58,6 +66,7 @@ public:
 private:
     bool signIn();
     bool isDavServer();
+    HttpResponse believed(HttpResponse answer);
     HttpResponse options();
     std::vector<HttpResponse> optionsAndMore(std::vector<HttpRequest> requests);
     CXDAVError errorFrom(const HttpResponse& answer, const char* asked) const;
@@ -66,6 +75,8 @@ private:
     const EndpointMap _map;
     const std::shared_ptr<HttpTransport> _transport;
     CurlTransport* const _signsIn; // gets the credentials; none when the transport has its own
+
+    RequestFailures _failures;
 
     std::mutex _mutex; // guards the following
     std::optional<std::string> _password;
