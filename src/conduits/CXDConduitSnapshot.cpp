@@ -135,7 +135,10 @@ void CXDConduit::readLocation(const RemoteLocation& location, Dictionary& state)
         _engine.revokeRemoteLocation(location, subscription ? std::optional(subscription->uniqueId()) : std::nullopt);
         removeRecordsAssociateWithRemoteLocation(location);
     }
-    if (!userState || !isTrusted(user, *userState)) return;
+    if (!userState) return _engine.treeWasLookedAt(user, forbidden ? TreeLook::ended : TreeLook::notRead);
+    if (!isTrusted(user, *userState)) return _engine.treeWasLookedAt(user, TreeLook::leftAlone);
+    // Without a serial number nothing of it counts.
+    _engine.treeWasLookedAt(user, (*userState)[kSerialNumber].isString() ? TreeLook::read : TreeLook::notRead);
     if (!userState->contains(layout::kAllGroup)) Dictionary(*userState).set(layout::kAllGroup, listOf(*userState));
     state.set(user.str(), *userState);
 }
@@ -263,6 +266,7 @@ void CXDConduit::compareUser(const UserName& user, const Dictionary& prior, cons
     const Value knownSerial = before[kSerialNumber];
     if (knownSerial.isString() && knownSerial.string() != serial.string()) {
         cancelSharingTo(baseText);
+        _engine.treeWasLookedAt(user, TreeLook::ended);
         return;
     }
     before.set(kSerialNumber, serial);

@@ -112,8 +112,11 @@ int CXDVaultraConduit::testReachability(const std::function<void()>& meanwhile) 
     const std::vector<std::string> origins = _world.manager.account().origins();
     const std::string address = origins.empty() ? "" : Url(origins.front() + "/").host();
     // Without a route nobody is asked, so nobody can refuse the password either.
-    const bool online = _world.network.canReachAddress(address) && _world.manager.canReach(error, meanwhile);
+    const bool routed = _world.network.canReachAddress(address);
+    if (!routed) error = {0, "There is no network."};
+    const bool online = routed && _world.manager.canReach(error, meanwhile);
     _vaultraOffLine = !online;
+    engine().storeWasTested(online, online ? 0 : error.code, online ? std::string() : error.reason);
     CXDLog("Vaultra is %@", online ? "online" : "offline");
     return error.code;
 }

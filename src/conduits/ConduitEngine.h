@@ -4,6 +4,7 @@
 #include "foundation/Value.h"
 #include "model/CXDChangeRecord.h"
 #include "model/Refusal.h"
+#include "model/TreeLook.h"
 
 #include <optional>
 #include <string>
@@ -33,6 +34,9 @@ public:
     virtual bool shouldChangeRecordBeCanceled(const CXDChangeRecord& record) const = 0; // any thread
     // The person is to be told. Any thread.
     virtual void noteRefused(const Refusal& /*refusal*/) {}
+    // For the outcome of the pass. Main thread.
+    virtual void storeWasTested(bool /*reached*/, int /*error: kCXDAVError…*/, const std::string& /*reason*/) {}
+    virtual void treeWasLookedAt(const UserName& /*user*/, TreeLook /*how*/) {}
     virtual bool lockURL(const Url& url) = 0; // any thread
     virtual int32_t sourcesForGUID(const UniqueId& group) = 0;
     virtual CXDConduit* conduitForSyncSource(int32_t source) = 0; // none when no conduit serves it

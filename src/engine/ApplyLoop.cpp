@@ -124,6 +124,7 @@ void ApplyLoop::run(CXDChangeRecords records, bool trickle, bool allowRetry) {
         applyAll(trickle);
     } catch (const CXException& e) {
         CXLog("applyChangeRecords: Caught %@: %@", e.name(), e.reason());
+        _parts.outcomes.caught(e.reason());
     } catch (...) {
         foreign = std::current_exception();
     }
@@ -135,6 +136,7 @@ void ApplyLoop::run(CXDChangeRecords records, bool trickle, bool allowRetry) {
         storeAndClose(allowRetry);
     } catch (const CXException& e) {
         CXLog("applyChangeRecords close: Caught %@: %@", e.name(), e.reason());
+        _parts.outcomes.couldNotStore(e.reason());
         if (trickle && !_queueStored) notStored = std::current_exception();
     }
     _parts.denied.clear(); // also when nothing could be stored: what comes again is to be asked again
@@ -310,11 +312,13 @@ void ApplyLoop::applyInOrder(const CXDChangeRecordPtr& record) {
 }
 
 bool ApplyLoop::applyTo(CXDConduit& conduit, int32_t source, const CXDChangeRecordPtr& record) {
+    if (source == CXDSyncSourceVaultra) _parts.outcomes.tried(*record);
     if (!conduit.applyChangeRecordIfNeeded(record, &_denied)) return false;
     const bool ofOwnGroup = conduit.swallows(*record) && noteSwallowed(*record);
     // Done with, but not remembered: the next comparison offers it again.
     if (!ofOwnGroup && !conduit.holds(*record)) return true;
     _parts.state.withConduitData([&](Dictionary& data) { didApplyChange(data, *record, source); });
+    _parts.outcomes.applied(*record, source);
     return true;
 }
 
@@ -375,9 +379,12 @@ void ApplyLoop::carryOver() {
 
 void ApplyLoop::storeAndClose(bool allowRetry) {
     if (!_queueTaken) append(_pendingChanges, _parts.state.getPendingChanges());
+    for (const CXDChangeRecordPtr& record : _parts.denied.all())
+        _parts.outcomes.refused(record->user().value_or(UserName()));
     std::erase_if(_pendingChanges, [&](const CXDChangeRecordPtr& record) { return _parts.denied.contains(*record); });
     CXDLog("Pending: %@", _pendingChanges);
     CXDLog("Denied:  %@", _parts.denied.all());
+    _parts.outcomes.leaves(_pendingChanges);
     // A change leaves the queue only when the database that took it has it on the disk. And what the database took is
     // known to have come from the store in the same moment: a copy that arrived in a pass which came to no end would be
     // taken for the user's own addition.
@@ -444,6 +451,7 @@ void ApplyLoop::bumpShareCount() {
         _parts.with.rolvane.save();
     } catch (const CXException& e) {
         CXLog("applyChangeRecords: Caught %@: %@", e.name(), e.reason());
+        _parts.outcomes.couldNotStore(e.reason());
         _parts.state.dropConduitData();
         recoverConduitData(_parts); // what was saved in the middle of the pass is there
         return;
@@ -452,10 +460,12 @@ void ApplyLoop::bumpShareCount() {
         preferences.set(kDaemonDomain, kCXDLastOstrelUser, user ? Value(*user) : Value());
         _parts.state.putConduitData();
         if (_queueStored && _underWay) _parts.state.setUnderWay(adrift(*_underWay, _parts.state.conduitData(), _end));
+        _parts.outcomes.put();
         _parts.with.rolvane.bumpShareCount(preferences);
         preferences.synchronize(kDaemonDomain);
     } catch (const CXException& e) {
         CXLog("applyChangeRecords: Caught %@: %@", e.name(), e.reason());
+        _parts.outcomes.couldNotStore(e.reason());
     }
 }
 

@@ -137,9 +137,15 @@ void CXDSyncEngine::performLater(std::function<void()> call) {
     });
 }
 
-void CXDSyncEngine::runPass(std::function<void()> pass) {
+void CXDSyncEngine::runPass(PassKind kind, std::function<void()> pass) {
     if (_parts->ending) return;
-    if (_passRunning) return performLater([this, pass = std::move(pass)] { runPass(pass); });
+    if (_passRunning) {
+        ++_parts->passesAskedFor;
+        return performLater([this, kind, pass = std::move(pass)] {
+            --_parts->passesAskedFor;
+            runPass(kind, pass);
+        });
+    }
     struct Running {
         bool& flag;
         explicit Running(bool& f) : flag(f) { flag = true; }
@@ -147,7 +153,15 @@ void CXDSyncEngine::runPass(std::function<void()> pass) {
     };
     {
         const Running running(_passRunning);
-        pass();
+        _parts->outcomes.begin(kind.full, kind.retry);
+        try {
+            pass();
+        } catch (const CXException& e) {
+            _parts->outcomes.caught(e.reason());
+            endPass(*_parts);
+            throw;
+        }
+        endPass(*_parts);
     }
     if (terminationRequested()) killCXD();
 }
@@ -156,7 +170,7 @@ void CXDSyncEngine::scheduleRetry() {
     _parts->retryScheduled = true;
     performLater([this] {
         _parts->retryScheduled = false;
-        bringSourcesUpToDateAndDoNotTryAgain();
+        makePass(false, true);
     });
 }
 
@@ -169,7 +183,11 @@ void CXDSyncEngine::bringSourcesUpToDateAndDoNotTryAgain() {
 }
 
 void CXDSyncEngine::bringSourcesUpToDateAndAllowRetry(bool allowRetry) {
-    runPass([this, allowRetry] {
+    makePass(allowRetry, false);
+}
+
+void CXDSyncEngine::makePass(bool allowRetry, bool isRetry) {
+    runPass({true, isRetry}, [this, allowRetry] {
         _parts->with.distributed.post({kStartedSyncing, std::nullopt, {}});
         checkCXShareCount();
         _parts->state.dropConduitData();
@@ -203,6 +221,7 @@ CXDChangeRecords CXDSyncEngine::gather() {
         if (!_parts->vaultraOffLine()) append(gathered, conduits.vaultra->changeRecords());
     } catch (const CXException& e) {
         CXLog("bringSourcesUpToDate: Caught %@: %@", e.name(), e.reason());
+        _parts->outcomes.caught(e.reason());
         unlockAllURLs();
     }
     return gathered;
@@ -220,7 +239,7 @@ void CXDSyncEngine::applyChangeRecords(CXDChangeRecords records, bool trickle, b
     // Whoever delivers them must not take them for done.
     if (_parts->ending)
         throw CXException(kCXInvalidArgumentException, "the process is ending, and its changes wait for the next one");
-    runPass([this, trickle, allowRetry, records = std::move(records)]() mutable {
+    runPass({!trickle, false}, [this, trickle, allowRetry, records = std::move(records)]() mutable {
         apply(std::move(records), trickle, allowRetry);
     });
 }
@@ -322,6 +341,13 @@ CXDConduit* CXDSyncEngine::conduitForSyncSource(int32_t source) {
 
 void CXDSyncEngine::noteRefused(const Refusal& refusal) {
     _parts->state.noteRefused(refusal);
+}
+void CXDSyncEngine::storeWasTested(bool reached, int error, const std::string& reason) {
+    _parts->outcomes.storeWasTested(
+        reached, reached ? std::nullopt : std::optional(PassFailure{{}, {}, 0, error, reason, std::nullopt}));
+}
+void CXDSyncEngine::treeWasLookedAt(const UserName& user, TreeLook how) {
+    _parts->outcomes.treeWasLookedAt(user, how);
 }
 bool CXDSyncEngine::shouldChangeRecordBeCanceled(const CXDChangeRecord& record) const {
     return _parts->denied.contains(record);

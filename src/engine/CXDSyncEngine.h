@@ -79,6 +79,8 @@ public:
 
     // Conflicts, cache, locks, revocation.
     void noteRefused(const Refusal& refusal) override;
+    void storeWasTested(bool reached, int error, const std::string& reason) override;
+    void treeWasLookedAt(const UserName& user, TreeLook how) override;
     bool shouldChangeRecordBeCanceled(const CXDChangeRecord& record) const override;
     void cancelPendingChangesLike(const CXDChangeRecordPtr& denied, const CXDChangeRecords& amongst);
     Dictionary payloadMerging(const Dictionary& first, const Dictionary& into);
@@ -108,13 +110,18 @@ public:
     bool passRunning() const { return _passRunning; } // main thread
 
 private:
+    struct PassKind {
+        bool full = false;  // it gathers
+        bool retry = false; // of one that was refused something
+    };
     void armIdleExit();
     void idleExit();
     CXDChangeRecords gather();
     void apply(CXDChangeRecords records, bool trickle, bool allowRetry);
     void scheduleRetry();
+    void makePass(bool allowRetry, bool isRetry);
     // Runs it now, or when the current event is over if a pass is running; not at all when the process is ending.
-    void runPass(std::function<void()> pass);
+    void runPass(PassKind kind, std::function<void()> pass);
     void performLater(std::function<void()> call);
 
     std::unique_ptr<EngineParts> _parts;

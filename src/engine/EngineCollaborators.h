@@ -1,5 +1,6 @@
 #pragma once
 
+#include "engine/PassOutcome.h"
 #include "foundation/Date.h"
 #include "foundation/Notification.h"
 #include "foundation/Preferences.h"
@@ -13,6 +14,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <vector>
 
 namespace rolvane {
 
@@ -79,6 +81,11 @@ struct EngineCollaborators {
     std::shared_ptr<InterruptibleSleep> renewalSleep; // none: the steady clock's
     // Gives back locks on the store that killed runs of this program hold; at each gathering, while the store is there.
     std::function<void()> releaseLocksOfEndedRuns = {};
+    // The requests to the store that have failed since it was asked last, in order.
+    std::function<std::vector<PassFailure>()> takeFailures = {};
+    // At the very end of every pass, on the main thread, when its outcome is stored and broadcast. May start no pass
+    // itself; it may ask the run loop for one.
+    std::function<void(const PassOutcome& outcome)> passEnded = {};
 };
 
 } // namespace rolvane

@@ -34,13 +34,47 @@ bool isEmpty(const std::optional<UserName>& user) {
     return !user || user->empty();
 }
 
+// What is shared over the network store, the own first. Nothing from another thread: the main one may be at work.
+std::optional<std::vector<PassFacts::Shared>> shared(const EngineParts& parts) {
+    const auto own = parts.with.account.vaultraUser();
+    if (std::this_thread::get_id() != parts.mainThread || isEmpty(own) || !parts.conduits.vaultra) return std::nullopt;
+    const Dictionary unsaved = parts.with.preferences.get(kDaemonDomain, kCXDUnsavedAccessLists).dictionary();
+    std::vector<PassFacts::Shared> all;
+    const auto add = [&](const UserName& user) {
+        const CXDConduit& network = *parts.conduits.vaultra;
+        const auto base = network.baseLocationForUser(network.realUserFromUser(user));
+        const std::string location = base ? base->absoluteString() : std::string();
+        all.push_back({user, location, unsaved.contains(location)});
+    };
+    if (parts.with.rolvane.allGroup()->valueForProperty(kCXRemoteLocationProperty)) add(kSelf);
+    for (const CXSubscriptionRef& subscription : parts.with.rolvane.subscriptions()) {
+        const RemoteLocation location = subscription->remoteLocation();
+        if (syncSourceForRemoteLocation(location) != CXDSyncSourceVaultra) continue;
+        const auto user = userForRemoteLocation(location, own, parts.with.loginName);
+        if (user && !user->empty() && user != kSelf) add(*user);
+    }
+    return all;
+}
+
 } // namespace
 
 EngineParts::EngineParts(const EngineCollaborators& collaborators)
     : with(collaborators), state(collaborators.preferences),
-      locks(collaborators.makeLock, collaborators.clock, sleepOf(collaborators)) {}
+      locks(collaborators.makeLock, collaborators.clock, sleepOf(collaborators)),
+      outcomes(collaborators.preferences, collaborators.clock,
+               {[this] { return shared(*this); }, collaborators.takeFailures,
+                [this] { return retryScheduled || passesAskedFor > 0; }}) {}
 
-void killCXD(const EngineParts& parts) {
+void endPass(EngineParts& parts) {
+    if (!parts.outcomes.running()) return;
+    const PassOutcome outcome = parts.outcomes.end();
+    parts.with.distributed.post({kCXDPassEndedNotification, std::nullopt, encodeOutcome(outcome).dictionary()});
+    if (parts.with.passEnded && std::this_thread::get_id() == parts.mainThread) parts.with.passEnded(outcome);
+}
+
+void killCXD(EngineParts& parts) {
+    if (parts.outcomes.running()) parts.outcomes.caught("RolvaneManager ended before the pass did.");
+    endPass(parts);
     parts.with.progress.stop();
     if (std::this_thread::get_id() == parts.mainThread) {
         parts.ending = true; // whatever arrives in that turn starts no pass
@@ -114,7 +148,9 @@ void updateStateAndExitIfNeeded(EngineParts& parts) {
     forgetFormerSubscriptions(parts);
     if (save) rolvane.save();
     // Two, not one: an owner who publishes nothing and has one subscription (the built-in one) is not served.
-    if (!publishes && subscriptions < 2) killCXD(parts);
+    if (publishes || subscriptions >= 2) return;
+    endPass(parts);
+    killCXD(parts);
 }
 
 void forgetFormerSubscriptions(EngineParts& parts) {

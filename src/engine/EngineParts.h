@@ -4,6 +4,7 @@
 #include "engine/DeniedChanges.h"
 #include "engine/EngineCollaborators.h"
 #include "engine/EngineState.h"
+#include "engine/OutcomeKeeper.h"
 #include "engine/RemoteLocks.h"
 #include "engine/Revocation.h"
 
@@ -24,19 +25,24 @@ struct EngineParts {
     DeniedChanges denied;
     Revocation revoked;
     RemoteLocks locks;
+    OutcomeKeeper outcomes;
     EngineConduits conduits;
     std::atomic<bool> terminating{false};      // passes wind down: what is not applied yet stays pending
     mutable bool ending = false;               // killCXD has begun; main thread
     bool retryScheduled = false;               // a retry pass waits on the run loop; main thread
+    int passesAskedFor = 0;                    // those that wait for the end of the one that runs; main thread
     std::function<void()> beforeSaveInThePass; // while changes are applied in order; main thread
     const std::thread::id mainThread = std::this_thread::get_id();
 
     bool vaultraOffLine() const { return conduits.vaultraOffLine && conduits.vaultraOffLine(); }
 };
 
-// Ends the process: progress stops, the run loop turns once so that what is queued goes out, exit status 0.
-// From another thread than the main one the run loop is left alone.
-[[noreturn]] void killCXD(const EngineParts& parts);
+// Puts down and broadcasts how the pass has ended. Nothing when none runs. Any thread that may end the process.
+void endPass(EngineParts& parts);
+
+// Ends the process, and the pass when one runs: progress stops, the run loop turns once so that what is queued goes
+// out, exit status 0. From another thread than the main one the run loop is left alone.
+[[noreturn]] void killCXD(EngineParts& parts);
 
 // checkCXShareCount: forgets everything when the database is not the one of the last pass, or the account is another.
 void checkCXShareCount(EngineParts& parts);

@@ -121,7 +121,9 @@ int32_t OutOfOrderWork::apply(const CXDChangeRecordPtr& record, bool& denied) {
 }
 
 bool OutOfOrderWork::applyTo(CXDConduit& conduit, int32_t source, const CXDChangeRecordPtr& record, bool& denied) {
+    if (source == CXDSyncSourceVaultra) _parts.outcomes.tried(*record);
     if (!conduit.applyChangeRecordIfNeeded(record, &denied)) return false;
+    _parts.outcomes.applied(*record, source);
     const std::lock_guard guard(_processedChangesLock);
     _parts.state.withConduitData([&](Dictionary& data) { didApplyChange(data, *record, source); });
     return true;
