@@ -12,6 +12,7 @@
 #include "daemon/InstanceLock.h"
 #include "daemon/TerminationWatch.h"
 #include "engine/CXDSyncEngine.h"
+#include "engine/StoreFailures.h"
 #include "foundation/FreeMemory.h"
 #include "foundation/Log.h"
 #include "foundation/Paths.h"
@@ -116,7 +117,7 @@ private:
             CXRolvane::sharedLocalRolvane(), Preferences::shared(), *_bus, _loop, Clock::system(), _progress,
             _processEnd, *_account, IdleExit::process(), [](const Url& url) { return CXWebDAVLock::initWithURL(url); },
             [this, &store](ConduitEngine& owner) { return makeConduits(owner, store); }, loginUserName(), nullptr,
-            [&store] { releaseLocksOfEndedRuns(store); }});
+            [&store] { releaseLocksOfEndedRuns(store); }, [&store] { return takeFailures(store); }});
         _progress.setEngine(engine.get(), engine.get());
         termination().engine = engine.get();
         if (termination().asked) termination().ask(); // it came while the engine was being made

@@ -17,6 +17,7 @@ void OutcomeKeeper::begin(bool full, bool retry) {
     _facts.retry = retry;
     _put.reset();
     _running = true;
+    if (_sources.failures) (void)_sources.failures(); // of what was before
     if (_previous) return;
     try {
         _previous = lastOutcome(_preferences);
