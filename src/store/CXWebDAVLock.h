@@ -16,10 +16,12 @@ class CXWebDAVLock {
 public:
     virtual ~CXWebDAVLock() = default;
 
-    // True when it is held afterwards, and when the store lets us write nothing there, so that no lock is needed. Does
-    // not wait for another holder.
+    // True when it is held afterwards, and when none is needed: the store lets us write nothing there, or keeps no
+    // locks at all. Does not wait for another holder.
     virtual bool tryLock() = 0;
-    virtual void unlock() = 0;       // nothing when not held; a failure leaves the lock to expire
+    // A lock that is not held is given back, too, where the store may have granted it unheard. What fails is left to
+    // the next one that asks, or to expire.
+    virtual void unlock() = 0;
     virtual bool renew() = 0;        // false: the lock is lost and no longer held
     virtual bool locked() const = 0; // taken, not released, not known to be lost
     // When the lock ends unless it is renewed. Of a lock that is not held: lockTimeout() from now, at every call, so
@@ -39,8 +41,9 @@ using LockFactory = std::function<std::shared_ptr<CXWebDAVLock>(const Url&)>;
 class CXDAVManager;
 // A lock on the store of this client. The client may end before the lock; operations then fail.
 std::shared_ptr<CXWebDAVLock> makeStoreLock(CXDAVManager& manager, const Url& url);
-// Gives back what runs of this user that have ended, killed most likely, still hold on the store: until their locks
-// expire, others would wait for nobody. Asks the store only where such a lock is known of. Never throws.
+// Gives back what runs of this user that have ended, killed most likely, still hold on the store, and what this client
+// may have there without holding it, because an answer was lost: until such locks expire, others would wait for nobody.
+// Asks the store only where such a lock is known of. While no lock of this client's is being asked for. Never throws.
 void releaseLocksOfEndedRuns(CXDAVManager& manager);
 std::shared_ptr<CXWebDAVLock> makeFileLock(const Url& fileUrl, Clock& clock = Clock::system());
 

@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <charconv>
 #include <initializer_list>
+#include <utility>
 
 namespace rolvane {
 
@@ -128,7 +129,8 @@ namespace {
 
 struct LockAnswerReader : XmlSax {
     LockAnswerReader() : XmlSax(32) {}
-    LockGrant grant;
+    std::vector<LockGrant> grants;
+    LockGrant grant; // the one that is being read
     std::string gathered;
 
     bool opened(const std::vector<std::string>&) override {
@@ -148,6 +150,7 @@ struct LockAnswerReader : XmlSax {
         }
         if (endsWith(path, {"activelock", "owner"})) grant.owner = content;
         if (endsWith(path, {"activelock", "locktoken", "href"})) grant.token = LockToken(content);
+        if (!path.empty() && path.back() == "activelock") grants.push_back(std::exchange(grant, {}));
         return true;
     }
     static bool endsWith(const std::vector<std::string>& path, std::initializer_list<std::string_view> end) {
@@ -158,10 +161,15 @@ struct LockAnswerReader : XmlSax {
 
 } // namespace
 
-std::optional<LockGrant> parseLockAnswer(std::string_view body) {
+std::optional<std::vector<LockGrant>> parseLockDiscovery(std::string_view body) {
     LockAnswerReader reader;
     if (body.size() > (1u << 20) || !reader.feed(body) || !reader.finish()) return std::nullopt;
-    return reader.grant;
+    return std::move(reader.grants);
+}
+
+std::optional<LockGrant> parseLockAnswer(std::string_view body) {
+    const auto grants = parseLockDiscovery(body);
+    return grants && !grants->empty() ? std::optional(grants->back()) : std::nullopt;
 }
 
 } // namespace rolvane

@@ -52,8 +52,10 @@ struct LockGrant {
     std::string owner;                    // the text of what the client said of the owner
     std::optional<double> timeoutSeconds; // nothing: infinite or not said
 };
-// Of a LOCK answer, or of a multistatus with the property lockdiscovery of one resource; of several active locks, what
-// the last one says. Nothing when the text is not one well-formed document. At most 1 MiB is looked at.
+// Of a LOCK answer; of several active locks, what the last one says. Nothing when the text is not one well-formed
+// document, or tells of no active lock. At most 1 MiB is looked at.
 std::optional<LockGrant> parseLockAnswer(std::string_view body);
+// The same of a multistatus with the property lockdiscovery of one resource: every active lock, in the server's order.
+std::optional<std::vector<LockGrant>> parseLockDiscovery(std::string_view body);
 
 } // namespace rolvane

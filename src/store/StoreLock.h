@@ -3,6 +3,7 @@
 #include "store/CXDAVManager.h"
 #include "store/CXWebDAVLock.h"
 #include "store/LockLedger.h"
+#include "store/Multistatus.h"
 
 #include <memory>
 #include <mutex>
@@ -26,9 +27,17 @@ public:
     const Url& url() const override { return _name; }
 
 private:
-    HttpResponse ask(const LockToken& refreshed);
+    enum class Had {
+        lock,
+        noNeed, // the store keeps none for us
+        none,
+        unknown, // it may stand, and the store does not tell
+    };
+    HttpResponse ask(const LockToken& refreshed, const std::string& mark = {});
+    Had attempt(CXDAVManager::Impl& client, const std::optional<LockToken>& orphan);
     bool take(const HttpResponse& answer, const LockToken& known);
-    bool takeOver(const std::optional<LockToken>& orphan);
+    bool keep(const LockGrant& grant);
+    bool takeOver(CXDAVManager::Impl& client, const std::optional<LockToken>& orphan);
     void lose(bool gone);
 
     const std::weak_ptr<CXDAVManager::Impl> _client;

@@ -165,6 +165,10 @@ HttpResponse StoreSession::send(HttpRequest request, Handled handled) {
     return judged(method, url, signIn() ? _transport->perform(std::move(request)) : unsent(), handled);
 }
 
+HttpResponse StoreSession::sendUnnoted(HttpRequest request) {
+    return believed(signIn() ? _transport->perform(std::move(request)) : unsent());
+}
+
 std::vector<HttpResponse> StoreSession::sendAll(std::vector<HttpRequest> requests, Handled handled) {
     std::vector<std::pair<std::string, Url>> asked;
     for (const HttpRequest& request : requests) asked.emplace_back(request.method, request.url);
@@ -197,6 +201,7 @@ std::vector<HttpResponse> StoreSession::optionsAndMore(std::vector<HttpRequest> 
         _davSeen = steadyMilliseconds();
         _accessLists = announcesDavClass(answer, "access-control") ? 1 : 0;
         _membersTags = announcesDavClass(answer, kMembersTagClass);
+        _mayKeepLocks = announcesDavClass(answer, "2");
     } else if (answer.status != 401) {
         _davSeen = 0;
     }

@@ -40,6 +40,8 @@ public:
     // An answer that is neither success nor handled is noted among the failures.
     HttpResponse send(HttpRequest request, Handled handled = nullptr);
     std::vector<HttpResponse> sendAll(std::vector<HttpRequest> requests, Handled handled = nullptr);
+    // The same, and nothing is noted: whoever asks in more than one way notes the failure when all have failed.
+    HttpResponse sendUnnoted(HttpRequest request);
     // Sends it and calls back with the answer as it came; whoever uses that has it judged then, on its own thread.
     void start(HttpRequest request, HttpTransport::Completion done);
     HttpResponse judged(std::string_view method, const Url& url, HttpResponse answer, Handled handled = nullptr);
@@ -52,6 +54,9 @@ public:
     // Whether the server announces access lists (RFC 3744 section 7.2), as it last said; asked when it never did.
     // Nothing when it does not answer.
     std::optional<bool> keepsAccessLists();
+    // False when the server has said last that it keeps no locks: it announces class 1 without class 2 (RFC 4918
+    // section 18). True as long as it has said nothing.
+    bool mayKeepLocks() const { return _mayKeepLocks; }
     // Whether the server tells the state of a collection's members by a tag, as it last said: a property of that name
     // counts only where the server announces it, since elsewhere any writer could set it.
     bool givesMembersTags() const { return _membersTags; }
@@ -84,6 +89,7 @@ private:
     bool _loginProven = false;  // a request that needs a login has succeeded
     std::atomic<bool> _signedIn{false};
     std::atomic<bool> _membersTags{false};
+    std::atomic<bool> _mayKeepLocks{true};
     std::atomic<int> _accessLists{-1}; // 1 or 0 as the server announced it last, -1: it never answered
     std::atomic<int64_t> _davSeen{0}; // steady milliseconds when the server last proved to be a WebDAV server; 0: never
 };
