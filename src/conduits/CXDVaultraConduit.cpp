@@ -219,6 +219,7 @@ bool CXDVaultraConduit::sanityCheckPublishStructure() {
 
 void CXDVaultraConduit::networkChanged() {
     CXDLog("Network changed");
+    _world.manager.networkChanged();
     testReachability();
     if (!_vaultraOffLine) engine().bringSourcesUpToDate();
 }

@@ -267,6 +267,9 @@ void CXDAVManager::saveVersionMemory() {
 void CXDAVManager::forgetVersion(const Url& url) {
     _impl->versions.forget(url.absoluteString());
 }
+void CXDAVManager::networkChanged() {
+    _impl->session.transport().networkChanged();
+}
 void CXDAVManager::abortAll() {
     _impl->session.transport().abortAll();
 }

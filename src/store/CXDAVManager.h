@@ -41,6 +41,7 @@ inline constexpr int kCXDAVErrorNoAccount = -1100; // no account, or one that ca
 // the same URL, the write goes through only if the file is still the one that was read (or still absent); otherwise
 // it fails with 412. When that read
 // failed for another reason than absence, the write is not sent and fails with code 0: what is there is not known.
+// Where the store holds just what was to be written, the write has succeeded.
 //
 // A URL may be a group's state file and its directory at once: the dictionary of a collection lies inside it under
 // kStateName, and a file in the way of a collection is moved there when the collection is made. Listings show one
@@ -141,6 +142,9 @@ public:
     void saveVersionMemory();
     // The next listing gives the file as one that was not seen yet, so that it is read once more.
     void forgetVersion(const Url& url);
+
+    // The machine has another network: connections that stand are not used again.
+    void networkChanged();
 
     // -- ending: every request under way and every later one fails at once. From any thread or a signal handler.
     void abortAll();

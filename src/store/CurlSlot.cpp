@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <arpa/inet.h>
 #include <cstring>
+#include <netinet/tcp.h>
 #include <new>
 #include <sys/socket.h>
 
@@ -14,6 +15,8 @@ void HttpJob::forgetAnswer() {
     response = {};
     headerDone = false;
     headerBytes = bodyBytes = 0;
+    tries = 0;
+    metDead = false;
     verdict = TransportError::none;
     verdictDetail.clear();
 }
@@ -24,6 +27,9 @@ bool HttpJob::mayCarryCredentials() const {
 }
 
 namespace {
+
+// Of bytes that nobody acknowledges: longer than lost packets take on a poor line, shorter than anybody likes to wait.
+constexpr unsigned kDeadMilliseconds = 10000;
 
 bool isLoopbackAddress(const char* text) {
     in_addr v4;
@@ -84,16 +90,17 @@ CurlSlot::~CurlSlot() {
     curl_slist_free_all(_headers);
 }
 
-void CurlSlot::prepare(std::unique_ptr<HttpJob> job, bool digest) {
+void CurlSlot::prepare(std::unique_ptr<HttpJob> job, const Setting& setting) {
     _job = std::move(job);
     _job->forgetAnswer();
     curl_easy_setopt(_easy, CURLOPT_URL, _job->request.url.absoluteString().c_str());
     curl_easy_setopt(_easy, CURLOPT_MAXFILESIZE_LARGE, static_cast<curl_off_t>(_job->request.limits.maxBodyBytes));
     setMethod();
     setHeaders();
-    setCredentials(digest);
+    setCredentials(setting.digest);
     setProxy();
     setVersion();
+    setConnection(setting);
     _plain = _job->origin.starts_with("http:");
     _bytesMoved = 0;
     _lastMove = std::chrono::steady_clock::now();
@@ -162,6 +169,14 @@ void CurlSlot::setVersion() {
     curl_easy_setopt(_easy, CURLOPT_PIPEWAIT, http1Only ? 0L : 1L);
 }
 
+// Over HTTP/1.1 a request that was sent before gets a connection of its own. Over HTTP/2, where all share one, libcurl
+// leaves a broken one by itself.
+void CurlSlot::setConnection(const Setting& setting) {
+    _shared = setting.shared;
+    curl_easy_setopt(_easy, CURLOPT_FRESH_CONNECT, _job->onNewConnection && !_shared ? 1L : 0L);
+    curl_easy_setopt(_easy, CURLOPT_MAXAGE_CONN, setting.longestIdle);
+}
+
 void CurlSlot::setProxy() {
     const bool off = isLoopbackHost(_job->request.url.host());
     if (off == _proxyOff) return;
@@ -190,14 +205,28 @@ bool CurlSlot::isHttp2() const {
     return version == CURL_HTTP_VERSION_2_0;
 }
 
-// A program that is started while the connection stands, such as a daemon, must not hold it.
-curl_socket_t CurlSlot::onOpen(void*, curlsocktype, curl_sockaddr* address) {
-    return ::socket(address->family, address->socktype | SOCK_CLOEXEC, address->protocol);
+bool CurlSlot::metOnlyOldConnections() const {
+    long opened = 0;
+    curl_easy_getinfo(_easy, CURLINFO_NUM_CONNECTS, &opened);
+    return opened == 0 && _job->headerBytes + _job->bodyBytes == 0;
 }
 
-// Plain http leaves only towards this machine, whatever the name in the URL resolved to.
+// A program that is started while the connection stands, such as a daemon, must not hold it.
+curl_socket_t CurlSlot::onOpen(void*, curlsocktype, curl_sockaddr* address) {
+    const int made = ::socket(address->family, address->socktype | SOCK_CLOEXEC, address->protocol);
+    if (made >= 0) ::setsockopt(made, IPPROTO_TCP, TCP_USER_TIMEOUT, &kDeadMilliseconds, sizeof kDeadMilliseconds);
+    return made;
+}
+
+// Plain http leaves only towards this machine, whatever the name in the URL resolved to. And libcurl, which repeats a
+// request on the next kept connection when one is dead, and gives up after five, is stopped at the second: the job then
+// goes out on a new one.
 int CurlSlot::onConnected(void* self, char* peerAddress, char*, int, int) {
     auto* slot = static_cast<CurlSlot*>(self);
+    if (++slot->_job->tries > 1 && !slot->_shared && slot->metOnlyOldConnections()) {
+        slot->_job->metDead = true;
+        return CURL_PREREQFUNC_ABORT;
+    }
     if (!slot->_plain || isLoopbackAddress(peerAddress)) return CURL_PREREQFUNC_OK;
     slot->_job->verdict = TransportError::refused;
     slot->_job->verdictDetail = "The store's address is not on this machine, so nothing is sent to it unencrypted.";

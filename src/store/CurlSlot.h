@@ -22,9 +22,12 @@ struct HttpJob {
     uint64_t epoch = 0; // of abortAll at the hand-over
     int repetitions = 0;
     bool http1Only = false;
+    bool onNewConnection = false; // a kept one has failed it
 
     HttpResponse response;
     bool headerDone = false; // of the final answer
+    int tries = 0;           // libcurl repeats a request by itself when a kept connection turns out to be dead
+    bool metDead = false;    // and has met the second one
     size_t headerBytes = 0, bodyBytes = 0;
     TransportError verdict = TransportError::none; // why the transfer was ended from our side
     std::string verdictDetail;
@@ -44,8 +47,13 @@ public:
     CURL* easy() const { return _easy; }
     HttpJob* job() const { return _job.get(); }
 
-    // Sets the handle up for the job. `digest`: the origin wants Digest.
-    void prepare(std::unique_ptr<HttpJob> job, bool digest);
+    struct Setting {
+        bool digest = false;    // the origin wants Digest
+        bool shared = false;    // over HTTP/2, as far as is known: requests share connections
+        long longestIdle = 118; // seconds without use, of a connection that may carry the job
+    };
+    // Sets the handle up for the job.
+    void prepare(std::unique_ptr<HttpJob> job, const Setting& setting);
     std::unique_ptr<HttpJob> release() { return std::move(_job); }
 
     // True when not a byte has moved for the job's idle limit.
@@ -53,6 +61,8 @@ public:
     // The same of so many seconds, as isIdle has seen it last.
     bool isStill(SteadyTime now, double seconds) const;
     bool isHttp2() const; // known when the connection is
+    // True when the job met kept connections only, and not a byte of an answer.
+    bool metOnlyOldConnections() const;
 
 private:
     static size_t onHeader(char* data, size_t size, size_t count, void* self);
@@ -67,6 +77,7 @@ private:
     void setCredentials(bool digest);
     void setProxy();
     void setVersion();
+    void setConnection(const Setting& setting);
 
     CURL* _easy;
     curl_slist* _headers = nullptr;
@@ -74,7 +85,7 @@ private:
     std::shared_ptr<const TransportCredentials> _signedInAs;
     const bool _offersHttp2;
     bool _http1Only = false;
-    bool _digest = false, _plain = false, _proxyOff = false;
+    bool _digest = false, _plain = false, _proxyOff = false, _shared = false;
     std::unique_ptr<HttpJob> _job;
     uint64_t _bytesMoved = 0;
     SteadyTime _lastMove;

@@ -1,15 +1,15 @@
 #include "foundation/Date.h"
-#include "store/Account.h"
+#include "store/CurlDecisions.h"
 #include "store/CurlSlot.h"
 #include "store/HttpTransport.h"
+#include "store/JobLine.h"
+#include "store/KeptConnections.h"
 
 #include <algorithm>
 #include <condition_variable>
-#include <deque>
 #include <mutex>
 #include <set>
 #include <signal.h>
-#include <strings.h>
 #include <sys/epoll.h>
 #include <sys/eventfd.h>
 #include <thread>
@@ -30,53 +30,6 @@ steady_clock::duration inSeconds(double s) {
     return duration_cast<steady_clock::duration>(duration<double>(s));
 }
 
-// The one place where libcurl's codes become ours.
-TransportError translated(CURLcode code) {
-    switch (code) {
-    case CURLE_OK: return TransportError::none;
-    case CURLE_OPERATION_TIMEDOUT: return TransportError::timedOut;
-    case CURLE_SSL_CONNECT_ERROR:
-    case CURLE_PEER_FAILED_VERIFICATION:
-    case CURLE_SSL_CERTPROBLEM:
-    case CURLE_SSL_CIPHER:
-    case CURLE_SSL_CACERT_BADFILE:
-    case CURLE_SSL_ISSUER_ERROR:
-    case CURLE_USE_SSL_FAILED: return TransportError::tls;
-    case CURLE_FILESIZE_EXCEEDED: return TransportError::tooLarge;
-    case CURLE_PARTIAL_FILE:
-    case CURLE_WEIRD_SERVER_REPLY:
-    case CURLE_BAD_CONTENT_ENCODING:
-    case CURLE_UNSUPPORTED_PROTOCOL: return TransportError::truncated;
-    case CURLE_URL_MALFORMAT: return TransportError::refused;
-    default: return TransportError::unreachable;
-    }
-}
-
-// True when the answer asks for Digest and does not take Basic.
-bool wantsDigest(const HttpResponse& answer) {
-    bool digest = false;
-    for (const auto& [name, value] : answer.headers) {
-        if (name != "www-authenticate") continue;
-        if (strncasecmp(value.c_str(), "basic", 5) == 0) return false;
-        digest = digest || strncasecmp(value.c_str(), "digest", 6) == 0;
-    }
-    return digest;
-}
-
-// Why a request cannot be sent as it stands, or "".
-std::string objection(const HttpJob& job) {
-    if (job.origin.starts_with("http:")) {
-        if (!isLoopbackHost(job.request.url.host()))
-            return "Plain http is used on this machine only; " + job.origin + " needs https.";
-    } else if (!job.origin.starts_with("https:")) {
-        return "Only http and https can be sent.";
-    }
-    for (const auto& [name, value] : job.request.headers)
-        if ((name + value).find_first_of(std::string_view("\r\n\0", 3)) != std::string::npos)
-            return "A header of the request holds a line break.";
-    return {};
-}
-
 } // namespace
 
 struct CurlTransport::Impl {
@@ -88,13 +41,13 @@ struct CurlTransport::Impl {
     void wake();
 
     // The transport's thread
+    void makeMulti();
     void run();
+    void renewConnections();
     void wait();
     void takeInbox();
-    void line(std::unique_ptr<HttpJob> job, bool again);
     void dropAborted();
     void admit();
-    bool heldBack(SteadyTime now);
     void launch(std::unique_ptr<HttpJob> job);
     bool reap(); // true when a transfer was complete
     void finished(CurlSlot& slot, CURLcode code);
@@ -116,17 +69,18 @@ struct CurlTransport::Impl {
     std::mutex inboxMutex; // guards inbox and credentials
     std::vector<std::unique_ptr<HttpJob>> inbox;
     std::shared_ptr<const TransportCredentials> credentials;
-    std::atomic<bool> sleeping{false}, stopping{false}, aborted{false};
+    std::atomic<bool> sleeping{false}, stopping{false}, aborted{false}, connectionsAreStale{false};
     std::atomic<uint64_t> abortEpoch{0};
-    std::atomic<uint64_t> requests{0}, connections{0}, challenged{0}, heldBackCount{0};
+    std::atomic<uint64_t> requests{0}, connections{0}, challenged{0}, heldBackCount{0}, sentAnewCount{0};
 
     // The transport's thread only
-    std::deque<std::unique_ptr<HttpJob>> pending; // those that give way behind the others
+    JobLine pending;
     std::vector<std::unique_ptr<CurlSlot>> slots;
     std::vector<CurlSlot*> idle;
     std::unordered_set<CurlSlot*> active;
     std::set<std::string> digestOrigins;
     std::set<std::string> http2Origins;
+    KeptConnections kept;
     SteadyTime notBefore{}; // Retry-After
     std::optional<SteadyTime> curlTimer;
     SteadyTime nextCheck{};
@@ -136,17 +90,29 @@ struct CurlTransport::Impl {
     std::thread thread;
 };
 
-CurlTransport::Impl::Impl(CurlTransportOptions o) : options(std::move(o)) {
+CurlTransport::Impl::Impl(CurlTransportOptions o)
+    : options(std::move(o)), kept(options.secondsAsleep ? options.secondsAsleep : KeptConnections::secondsAsleep) {
     static const CURLcode global = curl_global_init(CURL_GLOBAL_ALL);
     (void)global;
-    multi = curl_multi_init();
     epoll = epoll_create1(EPOLL_CLOEXEC);
     event = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
-    if (!multi || epoll < 0 || event < 0) throw std::bad_alloc();
+    if (epoll < 0 || event < 0) throw std::bad_alloc();
     epoll_event wanted{};
     wanted.events = EPOLLIN;
     wanted.data.fd = event;
     epoll_ctl(epoll, EPOLL_CTL_ADD, event, &wanted);
+    makeMulti();
+    thread = std::thread([this] {
+        sigset_t all; // signals are for the threads that expect them
+        sigfillset(&all);
+        pthread_sigmask(SIG_SETMASK, &all, nullptr);
+        run();
+    });
+}
+
+void CurlTransport::Impl::makeMulti() {
+    multi = curl_multi_init();
+    if (!multi) throw std::bad_alloc();
     curl_multi_setopt(multi, CURLMOPT_SOCKETFUNCTION, &Impl::onSocket);
     curl_multi_setopt(multi, CURLMOPT_SOCKETDATA, this);
     curl_multi_setopt(multi, CURLMOPT_TIMERFUNCTION, &Impl::onTimer);
@@ -155,12 +121,6 @@ CurlTransport::Impl::Impl(CurlTransportOptions o) : options(std::move(o)) {
     curl_multi_setopt(multi, CURLMOPT_MAXCONNECTS, static_cast<long>(options.maxConnections + 2));
     curl_multi_setopt(multi, CURLMOPT_MAX_CONCURRENT_STREAMS, static_cast<long>(options.maxStreams));
     curl_multi_setopt(multi, CURLMOPT_PIPELINING, static_cast<long>(CURLPIPE_MULTIPLEX));
-    thread = std::thread([this] {
-        sigset_t all; // signals are for the threads that expect them
-        sigfillset(&all);
-        pthread_sigmask(SIG_SETMASK, &all, nullptr);
-        run();
-    });
 }
 
 CurlTransport::Impl::~Impl() {
@@ -221,10 +181,23 @@ int CurlTransport::Impl::onTimer(CURLM*, long milliseconds, void* self) {
     return 0;
 }
 
+// Closes every connection and begins without any. While requests are under way it has to wait: theirs go on.
+void CurlTransport::Impl::renewConnections() {
+    if (!connectionsAreStale.exchange(false)) return;
+    const SteadyTime now = Steady::now();
+    for (const CurlSlot* slot : active) kept.foundDead(slot->job()->origin, now);
+    if (!active.empty()) return;
+    curl_multi_cleanup(multi);
+    curlTimer.reset();
+    makeMulti();
+}
+
 void CurlTransport::Impl::run() {
     while (!stopping) {
         takeInbox();
         dropAborted();
+        if (!pending.empty() && kept.hasSlept()) connectionsAreStale = true;
+        renewConnections();
         admit();
         wait();
         reap();
@@ -282,19 +255,8 @@ void CurlTransport::Impl::takeInbox() {
         if (job->epoch < abortEpoch)
             fail(std::move(job), TransportError::aborted, "The program is ending.");
         else
-            line(std::move(job), false);
+            pending.add(std::move(job));
     }
-}
-
-// Behind those that go before it or have come earlier; `again`: before those of its own kind.
-void CurlTransport::Impl::line(std::unique_ptr<HttpJob> job, bool again) {
-    const bool givesWay = job->request.givesWay;
-    const auto border = std::partition_point(pending.begin(), pending.end(),
-                                             [](const auto& other) { return !other->request.givesWay; });
-    if (again == givesWay)
-        pending.insert(border, std::move(job));
-    else
-        pending.insert(again ? pending.begin() : pending.end(), std::move(job));
 }
 
 // Abandons what was handed over before the latest abortAll.
@@ -305,30 +267,18 @@ void CurlTransport::Impl::dropAborted() {
     const std::vector<CurlSlot*> running(active.begin(), active.end());
     for (CurlSlot* slot : running)
         if (slot->job()->epoch < epoch) end(*slot, TransportError::aborted, "The program is ending.");
-    std::deque<std::unique_ptr<HttpJob>> kept;
-    for (auto& job : pending) {
-        if (job->epoch < epoch)
-            fail(std::move(job), TransportError::aborted, "The program is ending.");
-        else
-            kept.push_back(std::move(job));
-    }
-    pending = std::move(kept);
+    for (auto& job : pending.takeAll([epoch](const HttpJob& waiting) { return waiting.epoch < epoch; }))
+        fail(std::move(job), TransportError::aborted, "The program is ending.");
 }
 
 size_t CurlTransport::Impl::admissionLimit() const {
     return static_cast<size_t>(http2Origins.empty() ? options.maxConnections : options.maxStreams);
 }
 
-bool CurlTransport::Impl::heldBack(SteadyTime now) {
-    return notBefore > now;
-}
-
 void CurlTransport::Impl::admit() {
-    if (pending.empty() || heldBack(Steady::now())) return;
+    if (pending.empty() || notBefore > Steady::now()) return;
     while (!pending.empty() && active.size() < admissionLimit()) {
-        auto job = std::move(pending.front());
-        pending.pop_front();
-        launch(std::move(job));
+        launch(pending.takeFirst());
     }
 }
 
@@ -343,7 +293,9 @@ void CurlTransport::Impl::launch(std::unique_ptr<HttpJob> job) {
     const bool digest = scheme == TransportCredentials::Scheme::digest ||
                         (scheme == TransportCredentials::Scheme::automatic && digestOrigins.contains(job->origin));
     if (active.empty()) nextCheck = Steady::now() + milliseconds(100);
-    slot->prepare(std::move(job), digest);
+    const bool shared = !job->http1Only && http2Origins.contains(job->origin);
+    const long longestIdle = kept.longestIdle(job->origin, Steady::now());
+    slot->prepare(std::move(job), {digest, shared, longestIdle});
     active.insert(slot);
     ++requests;
     if (curl_multi_add_handle(multi, slot->easy()) != CURLM_OK)
@@ -375,8 +327,17 @@ void CurlTransport::Impl::finished(CurlSlot& slot, CURLcode code) {
     curl_easy_getinfo(slot.easy(), CURLINFO_NUM_CONNECTS, &opened);
     curl_easy_getinfo(slot.easy(), CURLINFO_HTTP_VERSION, &version);
     connections += static_cast<uint64_t>(opened);
+    const bool anew = needsNewConnection(slot, code);
     detach(slot);
     auto job = slot.release();
+    if (anew) {
+        ++sentAnewCount;
+        kept.foundDead(job->origin, Steady::now());
+        job->onNewConnection = true;
+        pending.addAgain(std::move(job));
+        return;
+    }
+    kept.heard(job->origin, job->response);
     if (version == CURL_HTTP_VERSION_2_0)
         http2Origins.insert(job->origin);
     else if (code == CURLE_OK && !job->http1Only && !http2Origins.empty())
@@ -385,7 +346,7 @@ void CurlTransport::Impl::finished(CurlSlot& slot, CURLcode code) {
     // libcurl may drop the answer then; over HTTP/1.1 it comes through.
     if (code == CURLE_HTTP2_STREAM && !job->headerDone && !job->http1Only && job->verdict == TransportError::none) {
         job->http1Only = true;
-        line(std::move(job), true);
+        pending.addAgain(std::move(job));
         return;
     }
     const bool refusedEarly = code == CURLE_HTTP2_STREAM && job->headerDone && job->response.status >= 400;
@@ -394,6 +355,8 @@ void CurlTransport::Impl::finished(CurlSlot& slot, CURLcode code) {
         const std::string detail = job->verdict != TransportError::none ? job->verdictDetail : curl_easy_strerror(code);
         return fail(std::move(job), error, detail);
     }
+    if (!job->headerDone)
+        return fail(std::move(job), TransportError::truncated, "The connection ended within the answer's header.");
     if (sendAgain(job)) return;
     auto done = std::move(job->done);
     done(std::move(job->response));
@@ -419,7 +382,7 @@ bool CurlTransport::Impl::sendAgain(std::unique_ptr<HttpJob>& job) {
         return false;
     }
     ++job->repetitions;
-    line(std::move(job), true);
+    pending.addAgain(std::move(job));
     return true;
 }
 
@@ -438,14 +401,9 @@ void CurlTransport::Impl::checkDeadlines() {
     nudge(now);
     for (auto& [slot, detail] : late) end(*slot, TransportError::timedOut, detail);
     // Whoever cannot be served before the deadline hears it now.
-    std::deque<std::unique_ptr<HttpJob>> kept;
-    for (auto& job : pending) {
-        if (job->deadline <= std::max(now, notBefore))
-            fail(std::move(job), TransportError::timedOut, "The store could not take the request in time.");
-        else
-            kept.push_back(std::move(job));
-    }
-    pending = std::move(kept);
+    const SteadyTime served = std::max(now, notBefore);
+    for (auto& job : pending.takeAll([served](const HttpJob& waiting) { return waiting.deadline <= served; }))
+        fail(std::move(job), TransportError::timedOut, "The store could not take the request in time.");
 }
 
 // httpd may forget the end of a stream, although it has sent the whole body, until something else moves on the
@@ -473,7 +431,7 @@ void CurlTransport::Impl::nudge(SteadyTime now) {
     job->deadline = now + inSeconds(kNudgeDeadline);
     job->epoch = abortEpoch;
     job->done = [](const HttpResponse&) {};
-    pending.push_front(std::move(job));
+    pending.addFirst(std::move(job));
 }
 
 void CurlTransport::Impl::end(CurlSlot& slot, TransportError error, std::string detail) {
@@ -523,6 +481,11 @@ void CurlTransport::resume() {
     _impl->aborted = false;
 }
 
+void CurlTransport::networkChanged() {
+    _impl->connectionsAreStale = true;
+    _impl->wake();
+}
+
 void CurlTransport::setCredentials(std::optional<TransportCredentials> credentials) {
     auto fresh = credentials ? std::make_shared<const TransportCredentials>(std::move(*credentials)) : nullptr;
     std::lock_guard guard(_impl->inboxMutex);
@@ -530,7 +493,7 @@ void CurlTransport::setCredentials(std::optional<TransportCredentials> credentia
 }
 
 CurlTransport::Statistics CurlTransport::statistics() const {
-    return {_impl->requests, _impl->connections, _impl->challenged, _impl->heldBackCount};
+    return {_impl->requests, _impl->connections, _impl->challenged, _impl->heldBackCount, _impl->sentAnewCount};
 }
 
 } // namespace rolvane

@@ -84,6 +84,9 @@ public:
     // from a signal handler.
     virtual void abortAll() = 0;
     virtual void resume() = 0;
+
+    // The machine has another network, or is awake again: connections that stand may be dead. They are not used again.
+    virtual void networkChanged() {}
 };
 
 // What a CurlTransport signs in with, and where.
@@ -100,6 +103,9 @@ struct CurlTransportOptions {
     int maxStreams = 100;             // on one HTTP/2 connection
     double maxRetryAfterSeconds = 60; // a longer Retry-After is taken as this
     bool http2 = true;                // offer it
+    // Seconds that the machine has spent asleep since its start; none: as the kernel has it. For tests. On the
+    // transport's thread.
+    std::function<double()> secondsAsleep;
 };
 
 // The transport over libcurl: one thread owns a multi handle and every connection; other threads hand requests over.
@@ -108,6 +114,11 @@ struct CurlTransportOptions {
 // peer that is the loopback interface (the address of the connection is checked, not the name). Digest costs one
 // challenge a connection handle, then goes unasked too. A 503 or 429 with Retry-After holds back all requests to all
 // places until then, and the refused request is sent once more if its deadline allows.
+//
+// A request that fails on a kept connection before a byte of the answer came is sent once more on a new one, if
+// mayBeSentTwice: the server may have carried the first one out. Connections that nobody used for 30 seconds, or nearly
+// as long as the server said it keeps them, are not used again; nor is any after the machine slept. Where nobody
+// acknowledges the bytes sent for 10 seconds, the connection is dead.
 class CurlTransport : public HttpTransport {
 public:
     explicit CurlTransport(CurlTransportOptions options);
@@ -117,6 +128,7 @@ public:
     void start(HttpRequest request, Completion done) override;
     void abortAll() override;
     void resume() override;
+    void networkChanged() override;
 
     // Requests handed over from now on carry these; none: no credentials.
     void setCredentials(std::optional<TransportCredentials> credentials);
@@ -126,6 +138,7 @@ public:
         uint64_t connections = 0; // opened
         uint64_t challenged = 0;  // 401 answers
         uint64_t heldBack = 0;    // waits for a Retry-After
+        uint64_t sentAnew = 0;    // repetitions because a kept connection was dead
     };
     Statistics statistics() const;
 

@@ -17,6 +17,7 @@ constexpr std::string_view kMakingSuffix = ".making";
 constexpr PropertyListLimits kReadLimits{.maxDepth = 48};
 constexpr size_t kMaxKnownCollections = 20000;
 constexpr int kOk = 200;
+constexpr int kNoContent = 204;
 
 // The dictionary that a thread read last, and what its next write to the same place has to find there.
 struct ReadMark {
@@ -95,6 +96,9 @@ bool mayMeanACollection(int status) {
 }
 bool isInTheWay(int status) {
     return status == 405 || status == 409 || (status >= 300 && status < 400);
+}
+bool isGoneOrChanged(int status) {
+    return status == 404 || status == 412;
 }
 bool isAny(int) {
     return true;
@@ -314,14 +318,24 @@ HttpResponse StoreFiles::put(const Url& name, const Url& target, const std::shar
     HttpResponse answer = _session.send(std::move(request), isAny);
     _early.forget(target);
     _ahead.forget(target);
-    if (answer.ok()) {
-        const std::string* tag = answer.header("etag");
-        const std::string* date = answer.header("date");
-        _versions.wrote(name.absoluteString(), tag ? EntityTag(*tag) : EntityTag(),
-                        date ? Date::fromHTTP(*date) : std::nullopt, *body);
-        if (mayBeBoth(name)) keepWritten(name, *body);
-    }
+    if (answer.ok()) noteWritten(name, answer, *body);
     return answer;
+}
+
+void StoreFiles::noteWritten(const Url& name, const HttpResponse& answer, const std::string& text) {
+    const std::string* tag = answer.header("etag");
+    const std::string* date = answer.header("date");
+    _versions.wrote(name.absoluteString(), tag ? EntityTag(*tag) : EntityTag(),
+                    date ? Date::fromHTTP(*date) : std::nullopt, text);
+    if (mayBeBoth(name)) keepWritten(name, text);
+}
+
+// A write whose answer was lost on the way is sent again, and then meets its own version.
+bool StoreFiles::isWritten(const Url& name, const Url& target, const std::string& text) {
+    const HttpResponse there = _session.send(StoreSession::request("GET", target), isAny);
+    if (there.status != kOk || there.body != text) return false;
+    noteWritten(name, there, text);
+    return true;
 }
 
 int StoreFiles::write(const Url& name, std::string text, bool securely, const std::function<bool()>& repair) {
@@ -336,6 +350,8 @@ int StoreFiles::write(const Url& name, std::string text, bool securely, const st
     HttpResponse answer;
     const auto attempt = [&](const Url& target) {
         answer = put(name, target, body, conditions(mark, _tokens.tokenFor(target.absoluteString()), target));
+        const bool hasMetItself = answer.status == 412 && mark.set && isWritten(name, target, *body);
+        if (hasMetItself) answer.status = kNoContent;
         return answer.status;
     };
     const auto last = [&](int status) {
@@ -418,7 +434,11 @@ bool StoreFiles::moveIntoCollection(const Url& url, const EntityTag& tag) {
     HttpRequest move = StoreSession::request("MOVE", making);
     move.headers = {{"Destination", url.absoluteString()}, {"Overwrite", "T"}};
     if (!tag.empty()) move.headers.emplace_back("If", taggedCondition(url, "[" + tag.str() + "]"));
-    return _session.send(std::move(move)).ok();
+    const HttpResponse moved = _session.send(std::move(move), isGoneOrChanged);
+    // One that was sent again because its answer was lost finds the collection in its place.
+    if (moved.ok() || (isGoneOrChanged(moved.status) && kindOf(url) == Kind::collection)) return true;
+    _session.noteFailure("MOVE", url, moved);
+    return false;
 }
 
 } // namespace rolvane

@@ -19,7 +19,8 @@ namespace rolvane {
 
 // Reads, writes and removes the files of a store, names in, HTTP status codes out (0: no believable answer).
 // Resolves paths that are a group's state file and its directory at once, and makes the write that follows a read
-// conditional. Any thread.
+// conditional. A conditional write that fails with 412 while the store holds just what was to be written has succeeded:
+// its answer was lost and it was sent again. Any thread.
 class StoreFiles {
 public:
     StoreFiles(StoreSession& session, LockTokens& tokens, VersionMemory& versions);
@@ -68,6 +69,8 @@ private:
     void keepWritten(const Url& name, const std::string& text);
     HttpResponse put(const Url& name, const Url& target, const std::shared_ptr<const std::string>& body,
                      std::vector<std::pair<std::string, std::string>> headers);
+    bool isWritten(const Url& name, const Url& target, const std::string& text);
+    void noteWritten(const Url& name, const HttpResponse& answer, const std::string& text);
     enum class Kind { absent, file, collection, unknown };
     Kind kindOf(const Url& url, EntityTag* tag = nullptr);
     bool moveIntoCollection(const Url& url, const EntityTag& tag); // `tag`: the file's; empty when the store gives none

@@ -150,6 +150,11 @@ bool FakeHttpServer::answer(int fd, const FakeAnswer& answer) {
     return !answer.closes;
 }
 
+void FakeHttpServer::closeConnections() {
+    std::lock_guard guard(_mutex);
+    for (const int fd : _open) shutdown(fd, SHUT_RDWR);
+}
+
 std::vector<FakeRequest> FakeHttpServer::requests() const {
     std::lock_guard guard(_mutex);
     return _requests;

@@ -48,6 +48,8 @@ public:
     std::string origin() const { return "http://127.0.0.1:" + std::to_string(_port); }
     std::vector<FakeRequest> requests() const; // all so far, in order of arrival
     int connections() const { return _connections; }
+    // Closes every connection that stands, as a server does with those that nobody used for a while.
+    void closeConnections();
 
 private:
     void accept();
