@@ -207,7 +207,8 @@ std::optional<Dictionary> CXDConduit::fetchWorkingState(const Url& base, bool* f
 
 namespace {
 
-// A list says what somebody has written into it. Names that no member can have are left out, with one line a list.
+// A list says what somebody has written into it. Names that no member can have are left out, with one line a list. One
+// that is left with nothing counts as none: nobody has emptied it.
 void leaveStrangeNamesOut(Dictionary& groupState, const Url& location) {
     size_t strange = 0;
     std::string example;
@@ -221,7 +222,10 @@ void leaveStrangeNamesOut(Dictionary& groupState, const Url& location) {
             else if (++strange == 1)
                 example = name.string();
         }
-        if (sound.count() != listed->count()) groupState.set(key, sound);
+        if (sound.empty() && !listed->empty())
+            groupState.remove(key);
+        else if (sound.count() != listed->count())
+            groupState.set(key, sound);
     }
     if (strange != 0)
         CXLog("%d strange names in the list %@ are left out, the first of them: %@", static_cast<int>(strange),

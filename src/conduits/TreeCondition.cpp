@@ -67,10 +67,12 @@ TreeCondition treeCondition(const Dictionary& prior, const Dictionary& current, 
     if (prior[kEverybody].dictionary()[kMemberUIDState].array().empty()) return {};
     const bool hasContacts = !current[kPeopleState].dictionary()[kMemberUIDState].dictionary().empty();
     const Value& everybody = current[kEverybody];
-    if (!everybody.dictionary().contains(kMemberUIDState) && (everybody || !hasContacts || lastVisit))
+    const Array* listed = everybody.dictionary()[kMemberUIDState].arrayIf();
+    if (!listed && (everybody || !hasContacts || lastVisit))
         return {Kind::lostLists, "has lost the list of its contacts"};
     if (hasLostAGroup(prior, current)) return {Kind::lostAGroup, "has lost a group that it still names"};
-    if (!hasContacts) return {Kind::lostContacts, "has lost the contents of its contacts"};
+    const bool isEmptied = listed && listed->empty();
+    if (!hasContacts && !isEmptied) return {Kind::lostContacts, "has lost the contents of its contacts"};
     return {};
 }
 

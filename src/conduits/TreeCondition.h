@@ -15,8 +15,10 @@
 //
 //   "TreeDates" -> {"info" -> date, "dateFile" -> date}    of the tree's own files, as the store gives them
 //
-// beside the groups. Whoever publishes touches "dateFile" at the end of each pass and writes "info" once. So neither a
-// "dateFile" that is older than before nor another date of "info" is anybody's doing but the store's.
+// beside the groups. The list of everybody decides what the absence of all contacts means: a list that is there and
+// names nobody has been emptied, contact by contact; one that is not there, or is no list, has been lost. Whoever
+// publishes touches "dateFile" at the end of each pass and writes "info" once. So neither a "dateFile" that is older
+// than before nor another date of "info" is anybody's doing but the store's.
 namespace rolvane {
 
 inline constexpr const char* kTreeDates = "TreeDates";
@@ -27,7 +29,7 @@ struct TreeCondition {
         setBack,      // an older copy, or a copy whose files have got new dates
         lostLists,    // there were contacts, and what said so is gone
         lostAGroup,   // one that the tree's own lists still name; for a moment so while somebody deletes it
-        lostContacts, // there were contacts, and there is not one file of one
+        lostContacts, // there were contacts, their list names some, and there is not one file of one
     };
     Kind kind = Kind::sound;
     std::string sentence; // what is wrong, for a log; empty when nothing is

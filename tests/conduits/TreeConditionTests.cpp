@@ -81,8 +81,21 @@ TEST(TreeCondition, AListThatIsThereAndNamesNobodyAtAllIsALossAndAnEmptyOneIsNot
     Dictionary current = tree();
     current.set("AllCXGroup", Dictionary());
     EXPECT_EQ(kindOf(tree(), current), Kind::lostLists);
+    for (const Value& noList : {Value("nobody"), Value(7), Value(Dictionary())}) {
+        current.set("AllCXGroup", Dictionary{{kMemberUIDState, noList}});
+        EXPECT_EQ(kindOf(tree(), current), Kind::lostLists) << "what is no list says nothing";
+    }
     current.set("AllCXGroup", Dictionary{{kMemberUIDState, Array()}});
-    EXPECT_EQ(kindOf(tree(), current), Kind::sound) << "its owner has deleted everybody";
+    EXPECT_EQ(kindOf(tree(), current), Kind::sound) << "its owner has deleted everybody, one file is on its way out";
+    for (const Value& people : {Value(), Value(Dictionary{{kMemberUIDState, Dictionary()}})}) {
+        people ? current.set(kPeopleState, people) : current.remove(kPeopleState);
+        EXPECT_EQ(kindOf(tree(), current), Kind::sound) << "its owner has deleted everybody";
+        EXPECT_EQ(kindOf(tree(), current, kNow), Kind::sound) << "a writer has";
+    }
+    current.remove("G:CXGroup");
+    EXPECT_EQ(kindOf(tree(), current), Kind::sound) << "and the last group";
+    current.dictionaryFor("AllCXGroup").set(kSubgroupUIDState, Array{"G:CXGroup"});
+    EXPECT_EQ(kindOf(tree(), current), Kind::lostAGroup) << "which is listed";
 }
 
 TEST(TreeCondition, AGroupThatIsGoneAndStillNamedIsALossAndADeletedOneIsNot) {
@@ -97,6 +110,8 @@ TEST(TreeCondition, AGroupThatIsGoneAndStillNamedIsALossAndADeletedOneIsNot) {
 TEST(TreeCondition, ContactsWithoutASingleFileAreALoss) {
     Dictionary current = without(tree(), kPeopleState);
     EXPECT_EQ(kindOf(tree(), current), Kind::lostContacts);
+    current.dictionaryFor("AllCXGroup").set(kMemberUIDState, Array{"b:CXPerson"});
+    EXPECT_EQ(kindOf(tree(), current), Kind::lostContacts) << "one is left, its list says";
     current.set(kPeopleState, Dictionary{{kMemberUIDState, Dictionary{{"a:CXPerson", Dictionary()}}}});
     EXPECT_EQ(kindOf(tree(), current), Kind::sound) << "one that is away is nobody's news";
 }

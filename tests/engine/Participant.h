@@ -119,7 +119,8 @@ public:
         application->save();
         return group;
     }
-    // What is there of a location ("": the own): the people with their properties, and the groups with their members.
+    // What is there of a location ("": the own): the people with their properties, and the groups with their members
+    // and subgroups.
     // Written as text, so that two users' views compare.
     std::map<std::string, std::string> view(const std::string& location = {}) const {
         std::map<std::string, std::string> all;
@@ -135,6 +136,10 @@ public:
             for (const UniqueId& member : group->memberUniqueIds()) members.insert(cxNormalizedUID(member).str());
             std::string text = group->name() + ":";
             for (const std::string& member : members) text += " " + member;
+            std::set<std::string> subgroups;
+            for (const UniqueId& subgroup : group->subgroupUniqueIds())
+                subgroups.insert(cxNormalizedUID(subgroup).str());
+            for (const std::string& subgroup : subgroups) text += " +" + subgroup;
             all["group " + cxNormalizedUID(each.uniqueId).str()] = text;
         }
         return all;
