@@ -24,7 +24,7 @@ public:
             if (record->deleted || record->purged) removeRecord(uid, *record);
         for (const auto& [uid, record] : records)
             if (!record->deleted) writeRecord(uid, *record);
-        for (const auto& [group, changes] : work.memberships()) writeMembership(group, changes);
+        writeMemberships(work.memberships());
         if (work.shareCount()) _store.setShareCount(*work.shareCount());
         if (_save) _journal.prune();
     }
@@ -114,22 +114,46 @@ private:
              CXChangeKind::updated);
     }
 
-    void writeMembership(const UniqueId& group, const PendingMembership& changes) {
-        int64_t number = _store.rowNumber(group);
-        if (number == 0) return;
-        bool changed = false;
-        for (const UniqueId& member : changes.removed) changed |= _store.removeListed(number, _store.rowNumber(member));
-        for (const UniqueId& person : changes.choicesDropped)
-            changed |= _store.removeChoices(number, _store.rowNumber(person));
-        for (const UniqueId& member : changes.added)
-            if (!member.empty()) changed |= addMember(group, number, member);
-        for (const auto& [person, chosen] : changes.choices) changed |= writeChoices(number, person, chosen);
-        if (!changed) return;
-        _store.setModified(number, _date);
-        if (!_noted.contains(group))
-            note(cxUIDWithTableName(group,
-                                    cxIsSubscribed(group) ? kCXSubscribedGroupContentsTable : kCXGroupContentsTable),
-                 CXChangeKind::updated);
+    // All that leaves before all that joins: of groups that are turned round, one can only come below the other when
+    // that one has left it.
+    void writeMemberships(const std::map<UniqueId, PendingMembership>& memberships) {
+        std::vector<GroupToWrite> groups;
+        for (const auto& [group, changes] : memberships)
+            if (const int64_t number = _store.rowNumber(group); number != 0)
+                groups.push_back({group, number, changes, false});
+        for (GroupToWrite& group : groups) takeOut(group);
+        for (GroupToWrite& group : groups) putIn(group);
+        for (const GroupToWrite& group : groups)
+            if (group.changed) noteContents(group);
+    }
+
+    struct GroupToWrite {
+        const UniqueId& uid;
+        int64_t number;
+        const PendingMembership& changes;
+        bool changed;
+    };
+
+    void takeOut(GroupToWrite& group) {
+        for (const UniqueId& member : group.changes.removed)
+            group.changed |= _store.removeListed(group.number, _store.rowNumber(member));
+        for (const UniqueId& person : group.changes.choicesDropped)
+            group.changed |= _store.removeChoices(group.number, _store.rowNumber(person));
+    }
+
+    void putIn(GroupToWrite& group) {
+        for (const UniqueId& member : group.changes.added)
+            if (!member.empty()) group.changed |= addMember(group.uid, group.number, member);
+        for (const auto& [person, chosen] : group.changes.choices)
+            group.changed |= writeChoices(group.number, person, chosen);
+    }
+
+    void noteContents(const GroupToWrite& group) {
+        _store.setModified(group.number, _date);
+        if (_noted.contains(group.uid)) return;
+        const bool isCopy = cxIsSubscribed(group.uid);
+        note(cxUIDWithTableName(group.uid, isCopy ? kCXSubscribedGroupContentsTable : kCXGroupContentsTable),
+             CXChangeKind::updated);
     }
 
     bool addMember(const UniqueId& group, int64_t number, const UniqueId& member) {

@@ -98,6 +98,48 @@ TEST(Group, ACycleThatTwoProcessesMakeTogetherIsNotWritten) {
     EXPECT_TRUE(b->subgroups().empty());
 }
 
+// Nested groups that are put into another order in one save, in whatever order their identifiers sort.
+TEST(Group, NestedGroupsCanBeTurnedInOneSave) {
+    std::vector<std::string> names{"A:CXGroup", "B:CXGroup", "C:CXGroup"};
+    const auto chainOf = [](CXRolvane& database, const std::vector<std::string>& order) {
+        std::vector<CXGroupRef> chain;
+        for (const std::string& name : order)
+            chain.push_back(std::dynamic_pointer_cast<CXGroup>(database.recordForUniqueId(UniqueId(name))));
+        return chain;
+    };
+    const auto nest = [](const std::vector<CXGroupRef>& chain) {
+        for (const CXGroupRef& group : chain)
+            for (const CXGroupRef& below : group->subgroups()) group->removeSubgroup(below);
+        for (size_t i = 0; i + 1 < chain.size(); ++i) chain[i]->addSubgroup(chain[i + 1]);
+    };
+    TestDatabase d;
+    for (const std::string& name : names) d.addGroup(name, name);
+    CapturingLog log;
+    std::vector<std::vector<std::string>> orders;
+    do {
+        orders.push_back(names);
+        orders.push_back({names[0], names[1]});
+    } while (std::next_permutation(names.begin(), names.end()));
+    for (const auto& before : orders)
+        for (const auto& after : orders) {
+            for (const CXGroupRef& group : chainOf(*d, names))
+                for (const CXGroupRef& below : group->subgroups()) group->removeSubgroup(below);
+            nest(chainOf(*d, before));
+            d->save();
+            for (const CXGroupRef& group : chainOf(*d, before))
+                for (const CXGroupRef& below : group->subgroups()) group->removeSubgroup(below);
+            nest(chainOf(*d, after));
+            d->save();
+            const auto chain = chainOf(*d, after);
+            for (size_t i = 0; i < chain.size(); ++i) {
+                std::vector<UniqueId> expected;
+                if (i + 1 < after.size()) expected.emplace_back(after[i + 1]);
+                EXPECT_EQ(texts(chain[i]->subgroupUniqueIds()), texts(expected)) << after[i];
+            }
+        }
+    EXPECT_EQ(log.text(), "");
+}
+
 TEST(Group, MembersAndSubgroupsAreKeptApart) {
     TestDatabase d;
     CXGroupRef a = d.addGroup("A"), b = d.addGroup("B");
