@@ -81,8 +81,11 @@ public:
     // The manager that the base finds, else a new one, kept under the URL's own text.
     std::shared_ptr<CXACLManager> ACLManagerForRemoteLocation(const Url& location) override;
 
-    // A person or group that was put into a group is looked for: its content may not have come.
+    // A person or group that was put into a group is looked for: its content may not have come, and no group is put
+    // below itself. The same for choices that were made for a person in a group.
     bool holds(const CXDChangeRecord& record) override;
+    // A nesting that would be a circle: of groups that were turned round the former nesting is taken back later.
+    bool waitsForWhatFollows(const CXDChangeRecord& record) override;
     bool swallows(const CXDChangeRecord& record) const override; // by the kill switch
 
     void open() override;

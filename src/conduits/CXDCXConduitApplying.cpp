@@ -122,11 +122,28 @@ bool CXDCXConduit::swallows(const CXDChangeRecord& record) const {
 }
 
 bool CXDCXConduit::holds(const CXDChangeRecord& record) {
-    const bool addsPerson = record.type() == CXDAddRecordToGroup;
-    if (!addsPerson && record.type() != CXDAddGroupToGroup) return true;
-    if (!namesAllGroup(record) && !groupOf(record)) return false;
-    if (!addsPerson) return subgroupOf(record) != nullptr;
-    return (record.person() && _written.contains(*record.person())) || personOf(record) != nullptr;
+    const auto isThere = [&] {
+        return (record.person() && _written.contains(*record.person())) || personOf(record) != nullptr;
+    };
+    switch (record.type()) {
+    case CXDAddRecordToGroup: return (namesAllGroup(record) || groupOf(record)) && isThere();
+    case CXDAddGroupToGroup: {
+        const CXGroupRef subgroup = subgroupOf(record);
+        if (!subgroup || namesAllGroup(record)) return subgroup != nullptr;
+        const CXGroupRef group = groupOf(record);
+        return group && group->mayListSubgroup(subgroup);
+    }
+    case CXDUpdateDistributionList:
+        // No choices are what everybody has who was not there.
+        return record.inMemoryPayload().dictionary().empty() || (groupOf(record) && isThere());
+    default: return true;
+    }
+}
+
+bool CXDCXConduit::waitsForWhatFollows(const CXDChangeRecord& record) {
+    if (record.type() != CXDAddGroupToGroup || namesAllGroup(record)) return false;
+    const CXGroupRef group = groupOf(record), subgroup = subgroupOf(record);
+    return group && subgroup && !group->mayListSubgroup(subgroup);
 }
 
 // -- people
@@ -222,7 +239,7 @@ bool CXDCXConduit::addGroupToGroup(const CXDChangeRecordPtr& record) {
     if (group->mayListSubgroup(subgroup))
         group->addSubgroup(subgroup);
     else
-        CXDLog("%@ would make a group contain itself; left out", record);
+        CXDLog("%@ would make a group contain itself", record); // see waitsForWhatFollows
     return true;
 }
 

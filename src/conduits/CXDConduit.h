@@ -80,6 +80,8 @@ public:
     // record whose object it does not have; nobody may then take it for something that was there and was removed. Base:
     // yes.
     virtual bool holds(const CXDChangeRecord& record);
+    // After an apply without effect: may it have one when what follows in the pass has been applied? Base: no.
+    virtual bool waitsForWhatFollows(const CXDChangeRecord& /*record*/) { return false; }
 
     // Will this source call the record done without doing anything, because nobody has the right to such a change?
     // Base: no.

@@ -240,7 +240,7 @@ void ApplyLoop::applyInOrder() {
     const ReadingAhead ahead(_inOrder);
     const NotingArrivals noting(_parts, [this] { noteArrivals(); });
     for (; _inOrderDone < _inOrder.size(); ++_inOrderDone) {
-        const CXDChangeRecordPtr& record = _inOrder[_inOrderDone];
+        const CXDChangeRecordPtr record = _inOrder[_inOrderDone]; // there may be more on the way
         if (_inOrderDone == ahead.lastBut(kFew) && !_parts.terminating) _parts.conduits.vaultra->willClose();
         applyInOrder(record);
         ++_processedCount;
@@ -316,10 +316,28 @@ bool ApplyLoop::applyTo(CXDConduit& conduit, int32_t source, const CXDChangeReco
     if (!conduit.applyChangeRecordIfNeeded(record, &_denied)) return false;
     const bool ofOwnGroup = conduit.swallows(*record) && noteSwallowed(*record);
     // Done with, but not remembered: the next comparison offers it again.
-    if (!ofOwnGroup && !conduit.holds(*record)) return true;
+    if (!ofOwnGroup && !conduit.holds(*record)) {
+        if (conduit.waitsForWhatFollows(*record)) tryAgainAtTheEnd(source, record);
+        return true;
+    }
     _parts.state.withConduitData([&](Dictionary& data) { didApplyChange(data, *record, source); });
     _parts.outcomes.applied(*record, source);
     return true;
+}
+
+// Additions come before removals, and one may wait for the other. What still cannot be done then contradicts what else
+// is there; the next comparison offers it again.
+void ApplyLoop::tryAgainAtTheEnd(int32_t source, const CXDChangeRecordPtr& record) {
+    if (_secondTries.contains(record)) {
+        CXLog("%@ contradicts what is there already, and is left out until it does not", record);
+        return;
+    }
+    const CXDChangeRecordPtr again = record->copy();
+    again->setAppliesToSources(source);
+    _secondTries.insert(again);
+    _inOrder.push_back(again);
+    _parts.with.progress.willProcessChangeRecord(again);
+    ++_totalCount;
 }
 
 // What is remembered of an own group then is what the store holds, a name without a contact included, and not what the

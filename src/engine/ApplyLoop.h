@@ -42,6 +42,7 @@ private:
     void queue(); // _unhandled becomes the flat list
     CXDChangeRecords accepted();
     bool noteSwallowed(const CXDChangeRecord& record);
+    void tryAgainAtTheEnd(int32_t source, const CXDChangeRecordPtr& record);
     void split();
     void noteUnderWay();
     void applyOutOfOrder();
@@ -72,7 +73,8 @@ private:
     PassEnd _end;
     CXDChangeRecords _inOrder;
     size_t _inOrderDone = 0;
-    bool _arrivalsNoted = false; // for a save in the middle of the pass
+    std::unordered_set<CXDChangeRecordPtr> _secondTries; // at the end of _inOrder
+    bool _arrivalsNoted = false;                         // for a save in the middle of the pass
     std::unique_ptr<OutOfOrderWork> _outOfOrder;
     bool _denied = false; // handed to every in-order apply; never cleared in a pass
     std::unordered_set<UserName> _cancelledUsers;
