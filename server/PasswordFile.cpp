@@ -108,10 +108,11 @@ std::map<std::string, std::string, std::less<>> readEntries(const std::string& p
     return entries;
 }
 
-void writeEntries(const std::string& path, const std::map<std::string, std::string, std::less<>>& entries) {
+void writeEntries(const std::string& path, const std::map<std::string, std::string, std::less<>>& entries,
+                  mode_t mode) {
     std::string text;
     for (const auto& [user, rest] : entries) text += user + ":" + rest + "\n";
-    writeFileDurably(path, text, 0600);
+    writeFileDurably(path, text, mode);
 }
 
 } // namespace
@@ -125,8 +126,8 @@ std::string aprMD5Password(std::string_view password, std::string_view salt) {
     return out;
 }
 
-PasswordFile::PasswordFile(std::string passwordsPath, std::string digestsPath, std::string realm)
-    : _passwords(std::move(passwordsPath)), _digests(std::move(digestsPath)), _realm(std::move(realm)) {}
+PasswordFile::PasswordFile(std::string passwordsPath, std::string digestsPath, std::string realm, mode_t mode)
+    : _passwords(std::move(passwordsPath)), _digests(std::move(digestsPath)), _realm(std::move(realm)), _mode(mode) {}
 
 bool PasswordFile::isValidUser(std::string_view user) {
     const auto isAlphanumeric = [](char c) {
@@ -153,8 +154,8 @@ void PasswordFile::set(const std::string& user, const std::string& password) {
     auto digests = readEntries(_digests);
     passwords[user] = aprMD5Password(password, randomSalt());
     digests[user] = digestEntry(user, _realm, password);
-    writeEntries(_digests, digests);
-    writeEntries(_passwords, passwords);
+    writeEntries(_digests, digests, _mode);
+    writeEntries(_passwords, passwords, _mode);
 }
 
 bool PasswordFile::remove(const std::string& user) {
@@ -162,8 +163,8 @@ bool PasswordFile::remove(const std::string& user) {
     auto digests = readEntries(_digests);
     const bool known = passwords.erase(user) > 0;
     digests.erase(user);
-    writeEntries(_digests, digests);
-    writeEntries(_passwords, passwords);
+    writeEntries(_digests, digests, _mode);
+    writeEntries(_passwords, passwords, _mode);
     return known;
 }
 

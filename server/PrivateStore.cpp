@@ -7,6 +7,7 @@
 #include "server/PasswordFile.h"
 #include "server/StoreCertificates.h"
 #include "server/StoreConfiguration.h"
+#include "server/StorePlaces.h"
 #include "server/StoreProcess.h"
 
 #include <cerrno>
@@ -17,6 +18,7 @@
 #include <poll.h>
 #include <sys/file.h>
 #include <sys/inotify.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 namespace rolvane {
@@ -27,6 +29,8 @@ using namespace std::chrono_literals;
 
 constexpr auto kStartDeadline = 10s;
 constexpr int kFreshPortAttempts = 5;
+constexpr size_t kLongestProcessNumber = 32;
+constexpr size_t kLongestExplanation = 2000;
 
 [[noreturn]] void fail(const std::string& reason) {
     throw CXException(kCXPrivateStoreException, reason);
@@ -47,15 +51,16 @@ std::string orDefault(const std::string& stateDirectory) {
     return withoutLinks(stateDirectory.empty() ? rolvane::stateDirectory() + "/store" : stateDirectory);
 }
 
-std::string readIfThere(const std::string& path) {
-    return exists(path) ? readFile(path) : std::string();
+size_t sizeOf(const std::string& path) {
+    struct stat info {};
+    return lstat(path.c_str(), &info) == 0 ? static_cast<size_t>(info.st_size) : 0;
 }
 
 // Held by a launcher while it starts, stops or changes a store; one that comes second waits.
 class LauncherLock {
 public:
     explicit LauncherLock(const std::string& stateDirectory)
-        : _file(open((stateDirectory + "/launcher.lock").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600)) {
+        : _file(open((stateDirectory + "/launcher.lock").c_str(), O_RDWR | O_CREAT | O_NOFOLLOW | O_CLOEXEC, 0600)) {
         while (_file && flock(_file.get(), LOCK_EX) != 0)
             if (errno != EINTR)
                 fail("The store's directory " + stateDirectory + " cannot be locked: " + std::strerror(errno) + ".");
@@ -105,21 +110,24 @@ struct PrivateStore::Implementation {
     std::string pidFile() const { return state + "/run/httpd.pid"; }
     std::string settingsFile() const { return state + "/store.plist"; }
     std::string errorLog() const { return state + "/logs/error.log"; }
-    std::string outputFile() const { return state + "/logs/startup.log"; }
+    std::string outputFile() const { return state + "/startup.log"; }
     std::string davDirectory() const { return options.documentRoot + "/dav"; }
-    StoreCertificates certificates() const { return StoreCertificates(state + "/tls"); }
+    StoreCertificates certificates() const {
+        return StoreCertificates(state + "/tls", StorePlaces::fileMode(StoreIdentity::choose()));
+    }
     PasswordFile passwords() const {
-        return PasswordFile(state + "/conf/passwords", state + "/conf/digests", kStoreRealm);
+        return PasswordFile(state + "/conf/passwords", state + "/conf/digests", kStoreRealm,
+                            StorePlaces::fileMode(StoreIdentity::choose()));
     }
 
-    void makeDirectories();
+    void makeDirectories() const;
     int savedPort() const;
     std::optional<StoreProcess> running() const;
     StoreIdentity identityFor() const;
     void checkProgram() const;
     void endOrphans() const;
     void writeConfiguration(int port);
-    void handOver(const StoreIdentity& identity) const;
+    void makeTrees(const StoreIdentity& identity) const;
     void startLocked();
     bool tryStart(int port, const StoreIdentity& identity, bool mayMove);
     void waitUntilReady(const StoreProcess& process, int port, size_t logStart) const;
@@ -128,10 +136,8 @@ struct PrivateStore::Implementation {
     void usersChanged(bool wasRunning);
 };
 
-void PrivateStore::Implementation::makeDirectories() {
-    for (const char* name : {"", "/conf", "/tls", "/run", "/logs", "/locks", "/lists"})
-        CXPathUtils_MakeCompletePath(state + name, 0700);
-    CXPathUtils_MakeCompletePath(davDirectory(), 0700);
+void PrivateStore::Implementation::makeDirectories() const {
+    StorePlaces(state, options.documentRoot, StoreIdentity::choose()).make();
 }
 
 int PrivateStore::Implementation::savedPort() const {
@@ -140,16 +146,13 @@ int PrivateStore::Implementation::savedPort() const {
 }
 
 std::optional<StoreProcess> PrivateStore::Implementation::running() const {
-    const std::string text = readIfThere(pidFile());
+    const std::string text = textOfServersFile(pidFile(), kLongestProcessNumber);
     return StoreProcess::find(static_cast<pid_t>(std::atol(text.c_str())), configurationFile());
 }
 
 StoreIdentity PrivateStore::Implementation::identityFor() const {
     StoreIdentity identity = StoreIdentity::choose();
     if (!identity.change) return identity;
-    identity.own(state);
-    if (options.documentRoot == state + "/root") identity.own(options.documentRoot);
-    identity.own(davDirectory());
     identity.passFileModes = !identity.reaches(state) || !identity.reaches(davDirectory());
     return identity;
 }
@@ -174,21 +177,20 @@ void PrivateStore::Implementation::endOrphans() const {
 
 void PrivateStore::Implementation::writeConfiguration(int port) {
     if (options.tls) certificates().ensure(options.hosts, options.certificateLifetime);
-    writeFileDurably(configurationFile(), renderStoreConfiguration(readFile(options.configurationTemplate.empty()
-                                                                                ? storeTemplatePath()
-                                                                                : options.configurationTemplate),
-                                                                   options, port, LoopbackPort::hasIPv6()));
-    writeFileDurably(state + "/conf/users.conf", renderStoreUsers(davDirectory(), passwords().users(),
-                                                                  options.authentication, options.keepsAccessLists()));
+    const std::string form =
+        readFile(options.configurationTemplate.empty() ? storeTemplatePath() : options.configurationTemplate);
+    const mode_t mode = StorePlaces::fileMode(StoreIdentity::choose());
+    writeFileDurably(configurationFile(), renderStoreConfiguration(form, options, port, LoopbackPort::hasIPv6()), mode);
+    writeFileDurably(
+        state + "/conf/users.conf",
+        renderStoreUsers(davDirectory(), passwords().users(), options.authentication, options.keepsAccessLists()),
+        mode);
     writeFileDurably(settingsFile(), PropertyList::toXML(storeOptionsToDictionary(options, port)));
 }
 
-void PrivateStore::Implementation::handOver(const StoreIdentity& identity) const {
-    for (const char* name : {"/conf", "/tls", "/run", "/logs", "/locks", "/lists"}) identity.ownAllIn(state + name);
-    for (const auto& user : passwords().users()) {
-        CXPathUtils_MakeCompletePath(davDirectory() + "/" + user, 0700);
-        identity.own(davDirectory() + "/" + user);
-    }
+void PrivateStore::Implementation::makeTrees(const StoreIdentity& identity) const {
+    const StorePlaces places(state, options.documentRoot, identity);
+    for (const auto& user : passwords().users()) places.makeForUser(user);
 }
 
 void PrivateStore::Implementation::startLocked() {
@@ -212,8 +214,8 @@ void PrivateStore::Implementation::startLocked() {
 bool PrivateStore::Implementation::tryStart(int port, const StoreIdentity& identity, bool mayMove) {
     writeConfiguration(port);
     unlink(pidFile().c_str());
-    handOver(identity);
-    const size_t logStart = readIfThere(errorLog()).size();
+    makeTrees(identity);
+    const size_t logStart = sizeOf(errorLog());
     const StoreProcess process = StoreProcess::launch(
         {options.httpdProgram, "-d", state, "-f", configurationFile(), "-DFOREGROUND"}, identity, outputFile());
     try {
@@ -233,7 +235,7 @@ bool PrivateStore::Implementation::tryStart(int port, const StoreIdentity& ident
 void PrivateStore::Implementation::waitUntilReady(const StoreProcess& process, int port, size_t logStart) const {
     const DirectoryWatch watch(state + "/run");
     const auto deadline = std::chrono::steady_clock::now() + kStartDeadline;
-    while (!exists(pidFile()) || readIfThere(pidFile()).empty()) {
+    while (textOfServersFile(pidFile(), kLongestProcessNumber).empty()) {
         const auto left =
             std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
         if (process.hasExited()) fail("The store's httpd did not start. " + explanation(logStart));
@@ -245,10 +247,10 @@ void PrivateStore::Implementation::waitUntilReady(const StoreProcess& process, i
 }
 
 std::string PrivateStore::Implementation::explanation(size_t logStart) const {
-    const std::string log = readIfThere(errorLog());
-    std::string said = readIfThere(outputFile()) + (log.size() > logStart ? log.substr(logStart) : std::string());
-    constexpr size_t most = 2000;
-    if (said.size() > most) said = "..." + said.substr(said.size() - most);
+    const size_t logged = sizeOf(errorLog());
+    std::string said = textOfServersFile(outputFile(), kLongestExplanation) +
+                       textOfServersFile(errorLog(), logged > logStart ? logged - logStart : 0);
+    if (said.size() > kLongestExplanation) said = "..." + said.substr(said.size() - kLongestExplanation);
     return said.empty() ? "It said nothing; its log is " + errorLog() + "." : "It said:\n" + said;
 }
 
@@ -315,7 +317,8 @@ void PrivateStore::start() {
 }
 
 void PrivateStore::stop(Stop how) {
-    if (!exists(_implementation->state)) return;
+    if (!exists(_implementation->settingsFile())) return;
+    _implementation->makeDirectories();
     const LauncherLock lock(_implementation->state);
     _implementation->stopLocked(how);
 }
@@ -341,7 +344,7 @@ void PrivateStore::addUser(const std::string& user, const std::string& password)
     const LauncherLock lock(_implementation->state);
     const bool known = _implementation->passwords().contains(user);
     _implementation->passwords().set(user, password);
-    _implementation->handOver(_implementation->identityFor());
+    _implementation->makeTrees(_implementation->identityFor());
     if (!known) _implementation->usersChanged(_implementation->running().has_value());
 }
 
@@ -349,7 +352,6 @@ bool PrivateStore::removeUser(const std::string& user) {
     _implementation->makeDirectories();
     const LauncherLock lock(_implementation->state);
     if (!_implementation->passwords().remove(user)) return false;
-    _implementation->handOver(_implementation->identityFor());
     _implementation->usersChanged(_implementation->running().has_value());
     return true;
 }

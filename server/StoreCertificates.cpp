@@ -186,8 +186,8 @@ void StoreCertificates::make(const std::vector<std::string>& hosts, std::chrono:
     // The certificate that areGoodFor compares goes last: an interrupted renewal is seen and done again.
     CXPathUtils_MakeCompletePath(_directory, 0700);
     writeFileDurably(caFile(), toPEM(authority.get()), 0644);
-    writeFileDurably(keyFile(), toPEM(serverKey.get()), 0600);
-    writeFileDurably(certificateFile(), toPEM(server.get()), 0600);
+    writeFileDurably(keyFile(), toPEM(serverKey.get()), _keyMode);
+    writeFileDurably(certificateFile(), toPEM(server.get()), _keyMode);
 }
 
 } // namespace rolvane

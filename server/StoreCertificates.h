@@ -2,17 +2,19 @@
 
 #include <chrono>
 #include <string>
+#include <sys/types.h>
 #include <vector>
 
 namespace rolvane {
 
 // The store's own certificate authority and server certificate (EC P-256), as PEM files in one directory:
-//   ca.pem (0644) what clients trust, server.pem the server's certificate, server.key (0600) its key.
+//   ca.pem (0644) what clients trust, server.pem the server's certificate, server.key its key (the mode given).
 // The authority's key signs one certificate and is never written anywhere, so nobody can sign another one with it; a
 // renewal therefore makes a new authority, too.
 class StoreCertificates {
 public:
-    explicit StoreCertificates(std::string directory) : _directory(std::move(directory)) {}
+    explicit StoreCertificates(std::string directory, mode_t keyMode = 0600)
+        : _directory(std::move(directory)), _keyMode(keyMode) {}
 
     // Makes them when they are missing, unreadable, for other hosts (names or addresses), or within a tenth of their
     // lifetime (at most 30 days) of their end. True when it made them. CXException on failure.
@@ -27,6 +29,7 @@ private:
     void make(const std::vector<std::string>& hosts, std::chrono::seconds lifetime);
 
     std::string _directory;
+    mode_t _keyMode;
 };
 
 } // namespace rolvane

@@ -132,15 +132,17 @@ bool StoreIdentity::reaches(const std::string& path) const {
     return true;
 }
 
-void StoreIdentity::own(const std::string& path) const {
-    if (change && lchown(path.c_str(), uid, gid) != 0)
-        fail("The store's file " + path + " cannot be given to the user " + name + ": " + std::strerror(errno) + ".");
-}
-
-void StoreIdentity::ownAllIn(const std::string& directory) const {
-    if (!change) return;
-    own(directory);
-    for (const auto& entry : std::filesystem::recursive_directory_iterator(directory)) own(entry.path().string());
+int StoreIdentity::run(const std::function<int()>& action) const {
+    constexpr int kNotThatUser = 255;
+    const pid_t pid = fork();
+    if (pid < 0) fail(std::string("The store's user cannot be taken on: ") + std::strerror(errno) + ".");
+    if (pid == 0) _exit(becomeIdentity(*this) ? action() : kNotThatUser);
+    int status = 0;
+    while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {
+    }
+    const int result = WIFEXITED(status) ? WEXITSTATUS(status) : kNotThatUser;
+    if (result == kNotThatUser) fail("The store's user " + name + " cannot be taken on by this process.");
+    return result;
 }
 
 std::optional<StoreProcess> StoreProcess::find(pid_t pid, const std::string& configurationFile) {
@@ -166,7 +168,9 @@ std::vector<StoreProcess> StoreProcess::findAll(const std::string& configuration
 
 StoreProcess StoreProcess::launch(const std::vector<std::string>& command, const StoreIdentity& identity,
                                   const std::string& outputFile) {
-    FileHandle output(open(outputFile.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600));
+    // A new file, whatever was there: its old one may have another name somewhere else.
+    unlink(outputFile.c_str());
+    FileHandle output(open(outputFile.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0600));
     if (!output) fail("The store's file " + outputFile + " cannot be written: " + std::strerror(errno) + ".");
     int ends[2];
     if (pipe2(ends, O_CLOEXEC) != 0) fail(std::string("The store cannot be started: ") + std::strerror(errno) + ".");

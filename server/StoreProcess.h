@@ -1,6 +1,7 @@
 #pragma once
 
 #include <chrono>
+#include <functional>
 #include <optional>
 #include <string>
 #include <sys/types.h>
@@ -40,9 +41,9 @@ struct StoreIdentity {
     static StoreIdentity choose();
     // Whether that user may search every directory on the way to the path, the path itself included.
     bool reaches(const std::string& path) const;
-    // Hands the file or directory (not what is inside, no symbolic links followed) over to it. CXException on failure.
-    void own(const std::string& path) const;
-    void ownAllIn(const std::string& directory) const; // with what is inside, for small directories
+    // Carries the action out as that user, in a process of its own, and returns what the action returned (0 to 255).
+    // The action makes system calls and nothing else. CXException when the user cannot be taken on.
+    int run(const std::function<int()>& action) const;
 };
 
 // A running program, seen through a pidfd, so that a number that was given to somebody else is never taken for it.

@@ -83,7 +83,7 @@ AccessWorld::~AccessWorld() {
     if (variant != AccessVariant::sanitized) return;
     store.stop();
     std::string said;
-    for (const char* name : {"/logs/error.log", "/logs/startup.log"}) said += readFile(store.stateDirectory() + name);
+    for (const char* name : {"/logs/error.log", "/startup.log"}) said += readFile(store.stateDirectory() + name);
     for (const char* word : {"Sanitizer", "runtime error"}) EXPECT_EQ(said.find(word), std::string::npos) << said;
 }
 
