@@ -18,12 +18,11 @@ apr_status_t destroyState(void* state) {
     return APR_SUCCESS;
 }
 
-const Caller& callerOf(request_rec* r, const Configuration& c, bool groupsMatter) {
-    RequestState& state = stateOf(r);
-    if (!state.caller || state.caller->name != r->user) state.caller = Caller{r->user, {}};
-    if (groupsMatter && c.groupFile && state.caller->groups.empty())
-        state.caller->groups = groupsOf(r->user, fileText(c.groupFile));
-    return *state.caller;
+OwnersLists::Granted grantedBy(request_rec* r, const Configuration& c, const OwnersLists* lists) {
+    if (!lists || lists->empty()) return {};
+    Caller caller{r->user, {}};
+    if (c.groupFile && lists->mentionsGroups()) caller.groups = groupsOf(r->user, fileText(c.groupFile));
+    return lists->grantedTo(caller);
 }
 
 bool isGranted(request_rec* r, const Configuration& c, const TreePath& place, const Need& need) {
@@ -70,9 +69,15 @@ unsigned privilegesOn(request_rec* r, const Configuration& c, const TreePath& pl
     if (!r->user || !*r->user) return 0;
     if (place.isBase()) return kReading; // its members are shown by their own lists
     if (place.owner == r->user) return kEverything;
-    const OwnersLists* lists = listsOf(r, c, place.owner);
-    if (!lists || lists->empty()) return 0;
-    return lists->granted(callerOf(r, c, lists->mentionsGroups()), place.below);
+    RequestState& state = stateOf(r);
+    if (state.grantedTo != r->user) {
+        state.grantedTo = r->user;
+        state.granted.clear();
+    }
+    auto found = state.granted.find(place.owner);
+    if (found == state.granted.end())
+        found = state.granted.emplace(place.owner, grantedBy(r, c, listsOf(r, c, place.owner))).first;
+    return OwnersLists::together(found->second, place.below);
 }
 
 std::optional<Missing> missingOf(request_rec* r, const Configuration& c, const TreePath& place,

@@ -7,6 +7,7 @@
 
 #include <map>
 #include <optional>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -22,9 +23,17 @@ struct Missing {
 // belongs to the main request, which its sub-requests share.
 struct RequestState {
     std::map<std::string, std::optional<OwnersLists>> lists; // by owner; nothing: damaged
-    std::optional<Caller> caller;
-    std::optional<Missing> destinationLacks; // why the sub-request for a Destination was refused
+    std::string grantedTo;                                   // the user of the next
+    std::map<std::string, OwnersLists::Granted> granted;     // by owner
+    std::optional<std::set<std::string, std::less<>>> usersInFile;
+    std::map<std::string, bool, std::less<>> knownUsers; // as the providers said
+    std::optional<Missing> destinationLacks;             // why the sub-request for a Destination was refused
     std::vector<ListStore::Guard> guards;
+
+    void forgetLists() { // they are read anew
+        lists.clear();
+        granted.clear();
+    }
 };
 RequestState& stateOf(request_rec* r);
 

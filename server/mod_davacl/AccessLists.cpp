@@ -103,6 +103,7 @@ void addGrant(AccessList& list, const Grant& grant) {
 
 std::optional<OwnersLists> OwnersLists::parse(std::string_view text) {
     OwnersLists lists;
+    std::map<std::pair<std::string, Principal>, size_t> places; // of the entry in the list of the tree
     if (take(text, '\n') != kFirstLine) return std::nullopt;
     for (;;) {
         auto line = take(text, '\n');
@@ -116,7 +117,14 @@ std::optional<OwnersLists> OwnersLists::parse(std::string_view text) {
         const Grant grant{principal.value_or(Principal()), *rights == "r" || *rights == "rw",
                           *rights == "w" || *rights == "rw"};
         if (!tree || !principal || (!grant.read && !grant.write)) return std::nullopt;
-        addGrant(lists._lists[*tree], grant);
+        AccessList& list = lists._lists[*tree];
+        const auto [known, isNew] = places.try_emplace({*tree, *principal}, list.size());
+        if (isNew) {
+            list.push_back(grant);
+            continue;
+        }
+        list[known->second].read |= grant.read;
+        list[known->second].write |= grant.write;
     }
     if (!text.empty()) return std::nullopt;
     return lists;
@@ -168,15 +176,25 @@ bool OwnersLists::mentionsGroups() const {
     return false;
 }
 
-unsigned OwnersLists::granted(const Caller& caller, const std::vector<std::string>& segments) const {
-    unsigned privileges = 0;
-    if (caller.name.empty() || _lists.empty()) return privileges;
-    std::string tree;
-    for (size_t level = 0; level <= segments.size(); ++level) {
-        if (level) tree += (level > 1 ? "/" : "") + segments[level - 1];
-        for (const Grant& grant : at(tree))
+OwnersLists::Granted OwnersLists::grantedTo(const Caller& caller) const {
+    Granted granted;
+    if (caller.name.empty()) return granted;
+    for (const auto& [tree, list] : _lists) {
+        unsigned privileges = 0;
+        for (const Grant& grant : list)
             if (concerns(grant.principal, caller))
                 privileges |= (grant.read ? kReading : 0u) | (grant.write ? kWriting : 0u);
+        if (privileges) granted.emplace(tree, privileges);
+    }
+    return granted;
+}
+
+unsigned OwnersLists::together(const Granted& granted, const std::vector<std::string>& segments) {
+    unsigned privileges = 0;
+    std::string tree;
+    for (size_t level = 0; level <= segments.size() && !granted.empty(); ++level) {
+        if (level) tree += (level > 1 ? "/" : "") + segments[level - 1];
+        if (const auto found = granted.find(tree); found != granted.end()) privileges |= found->second;
     }
     return privileges;
 }

@@ -53,8 +53,15 @@ public:
     bool empty() const { return _lists.empty(); }
     bool mentionsGroups() const;
 
+    // What each list grants to the caller, by its tree: every entry is looked at once, however many places are asked
+    // about later.
+    using Granted = std::map<std::string, unsigned, std::less<>>;
+    Granted grantedTo(const Caller& caller) const;
     // What the lists of the places on the way down to the tree grant, together.
-    unsigned granted(const Caller& caller, const std::vector<std::string>& segments) const;
+    static unsigned together(const Granted& granted, const std::vector<std::string>& segments);
+    unsigned granted(const Caller& caller, const std::vector<std::string>& segments) const {
+        return together(grantedTo(caller), segments);
+    }
 
     bool operator==(const OwnersLists&) const = default;
 

@@ -11,8 +11,6 @@
 namespace rolvane::davacl {
 namespace {
 
-constexpr size_t kMostEntries = 1000;
-
 int aclMethodNumber = -1;
 
 // A precondition of section 8.1.1 that the request does not meet.
@@ -29,6 +27,19 @@ struct Request {
 
 const apr_xml_elem* child(const apr_xml_elem* of, const char* name) {
     return of ? dav_find_child(of, name) : nullptr;
+}
+
+size_t countOf(const apr_xml_elem* of, const char* name) {
+    size_t count = 0;
+    for (const apr_xml_elem* e = of ? of->first_child : nullptr; e; e = e->next)
+        if (e->ns == APR_XML_NS_DAV_ID && std::strcmp(e->name, name) == 0) ++count;
+    return count;
+}
+
+size_t elementsIn(const apr_xml_elem* of) {
+    size_t count = 0;
+    for (const apr_xml_elem* e = of ? of->first_child : nullptr; e; e = e->next) ++count;
+    return count;
 }
 
 std::string textOf(request_rec* r, const apr_xml_elem* element) {
@@ -92,15 +103,25 @@ std::optional<Unmet> readPrivileges(const apr_xml_elem* grant, Grant& into) {
     return any ? std::nullopt : std::optional(Unmet{nullptr, "DAV:grant is empty."});
 }
 
+// RFC 3744 section 5.5: one principal, who is one, and either grants or denials.
+bool isWellFormed(const apr_xml_elem* ace) {
+    const size_t principals = countOf(ace, "principal") + countOf(ace, "invert");
+    const apr_xml_elem* principal = child(child(ace, "invert") ? child(ace, "invert") : ace, "principal");
+    if (principals != 1 || elementsIn(principal) != 1 || countOf(ace, "grant") + countOf(ace, "deny") != 1)
+        return false;
+    const apr_xml_elem* property = child(principal, "property");
+    return !property || elementsIn(property) == 1;
+}
+
 std::optional<Unmet> readEntry(const Request& q, const apr_xml_elem* ace, AccessList& list) {
+    if (!isWellFormed(ace))
+        return Unmet{nullptr, "DAV:ace holds one DAV:principal, with one element in it, and one DAV:grant."};
     if (child(ace, "protected")) return checkProtected(q, ace);
     if (child(ace, "inherited")) return checkInherited(q, ace);
     if (child(ace, "invert")) return Unmet{"no-invert", "Inverted principals are not supported."};
     if (child(ace, "deny")) return Unmet{"grant-only", "What is not granted is denied."};
     const apr_xml_elem* principal = child(ace, "principal");
     const apr_xml_elem* grant = child(ace, "grant");
-    if (!principal || !principal->first_child || !grant)
-        return Unmet{nullptr, "DAV:ace holds one DAV:principal and one DAV:grant."};
     Grant asked;
     std::optional<Unmet> unmet;
     const auto who = readPrincipal(q, principal, unmet);
@@ -114,10 +135,13 @@ std::optional<Unmet> readEntry(const Request& q, const apr_xml_elem* ace, Access
 
 std::optional<Unmet> readList(const Request& q, const apr_xml_doc* doc, AccessList& list) {
     if (!doc || !doc->root || !dav_validate_root(doc, "acl")) return Unmet{nullptr, "The body must be a DAV:acl."};
+    // Before anybody is asked who they are: each entry may cost a look-up.
+    if (countOf(doc->root, "ace") > q.c.mostEntries())
+        return Unmet{"limited-number-of-aces",
+                     "A list holds at most " + std::to_string(q.c.mostEntries()) + " entries."};
     for (const apr_xml_elem* e = doc->root->first_child; e; e = e->next) {
         if (e->ns != APR_XML_NS_DAV_ID || std::strcmp(e->name, "ace") != 0) continue;
         if (auto unmet = readEntry(q, e, list)) return unmet;
-        if (list.size() > kMostEntries) return Unmet{"limited-number-of-aces", "A list holds at most 1000 principals."};
     }
     return std::nullopt;
 }

@@ -34,6 +34,13 @@ bool is(const request_rec* r, const char* method) {
     return std::strcmp(r->method, method) == 0;
 }
 
+// httpd's page for the status with these words in it.
+int badRequest(request_rec* r, const char* words) {
+    apr_table_setn(r->notes, "error-notes", words);
+    apr_table_setn(r->notes, "verbose-error-to", "*");
+    return HTTP_BAD_REQUEST;
+}
+
 bool mayHaveList(const Change& change, const TreePath& place) {
     return !place.isBase() && place.levels() <= change.c->levels();
 }
@@ -76,7 +83,7 @@ std::optional<Missing> hold(request_rec* r, const Change& change) {
         if (!state.guards.back()) return Missing{place, kWriteContent};
     }
     if (state.guards.empty()) return std::nullopt; // the owner's right does not come from a list
-    state.lists.clear();
+    state.forgetLists();
     auto missing = change.source ? missingOf(r, *change.c, *change.source, change.sourceNeeds) : std::nullopt;
     if (!missing && change.destination) missing = missingOf(r, *change.c, *change.destination, change.destinationNeeds);
     if (missing) state.guards.clear();
@@ -155,6 +162,9 @@ bool carriesListAway(request_rec* r, const Change& change) {
 // OK when the Destination may be written, or is not ours to judge; else what the handler returns.
 int lookAtDestination(request_rec* r, Change& change) {
     const char* text = apr_table_get(r->headers_in, "Destination");
+    // mod_dav takes an old name of the header, too, and makes a URL of it in a way of its own.
+    if (!text && apr_table_get(r->headers_in, "New-uri"))
+        return badRequest(r, "New-uri is not supported here. Send a Destination.");
     if (!text) return OK;
     const dav_lookup_result found = dav_lookup_uri(text, r, 0);
     if (!found.rnew) return OK; // mod_dav says what is wrong with it
@@ -190,6 +200,10 @@ int prepare(request_rec* r) {
     if (is(r, "COPY") || is(r, "MOVE"))
         if (const int answer = lookAtDestination(r, *change); answer != OK) return answer;
     if (!change->source && !change->destination) return DECLINED;
+    // mod_dav writes a part into the file where it stands, long before the last byte of the request is here (RFC 9110
+    // section 14.5 lets a server refuse it).
+    if (is(r, "PUT") && apr_table_get(r->headers_in, "Content-Range"))
+        return badRequest(r, "PUT with Content-Range is not supported here. Send the whole file.");
     if (is(r, "MKCOL") && !stands(r)) dropLists(r, *change, *change->source);
     ap_add_output_filter(kAnswer, change, r, r->connection);
     if (ap_request_has_body(r)) {

@@ -1,6 +1,9 @@
 #include "server/mod_davacl/Configuration.h"
 
+#include "server/mod_davacl/TreePath.h"
+
 #include <cstring>
+#include <string>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -59,6 +62,12 @@ const char* setGroupFile(cmd_parms* cmd, void*, const char* path) {
     return c->groupFile ? nullptr : "the argument must be the path of a group file";
 }
 
+const char* setUserFile(cmd_parms* cmd, void*, const char* path) {
+    Configuration* c = ofServer(cmd->server);
+    c->userFile = ap_server_root_relative(cmd->pool, path);
+    return c->userFile ? nullptr : "the argument must be the path of a password file";
+}
+
 const char* addUsers(cmd_parms* cmd, void*, const char* provider) {
     Configuration* c = ofServer(cmd->server);
     if (!ap_lookup_provider(AUTHN_PROVIDER_GROUP, provider, AUTHN_PROVIDER_VERSION))
@@ -69,13 +78,22 @@ const char* addUsers(cmd_parms* cmd, void*, const char* provider) {
     return nullptr;
 }
 
-const char* setDepth(cmd_parms* cmd, void*, const char* text) {
-    Configuration* c = ofServer(cmd->server);
+// False when the text is no number from 1 to `most`.
+bool readNumber(const char* text, int most, int& into) {
     char* end = nullptr;
-    const apr_int64_t depth = apr_strtoi64(text, &end, 10);
-    if (*end || depth < 1 || depth > 8) return "the depth must be a number from 1 to 8";
-    c->depth = static_cast<int>(depth);
-    return nullptr;
+    const apr_int64_t number = apr_strtoi64(text, &end, 10);
+    if (end == text || *end || number < 1 || number > most) return false;
+    into = static_cast<int>(number);
+    return true;
+}
+
+const char* setDepth(cmd_parms* cmd, void*, const char* text) {
+    return readNumber(text, 8, ofServer(cmd->server)->depth) ? nullptr : "the depth must be a number from 1 to 8";
+}
+
+const char* setMaxEntries(cmd_parms* cmd, void*, const char* text) {
+    return readNumber(text, 100000, ofServer(cmd->server)->entries) ? nullptr
+                                                                    : "the number of entries must be from 1 to 100000";
 }
 
 // AP_INIT_* want the one type of function in a union that C++ will not convert to.
@@ -92,8 +110,9 @@ bool isWithin(const char* path, const char* directory) {
 const char* complaintAbout(const server_rec* server) {
     const Configuration* c = ofServer(server);
     if (!c->base) {
-        if (c->principals || c->groupFile || c->users || c->depth)
-            return "DavAclPrincipals, DavAclGroupFile, DavAclUsers and DavAclDepth need a DavAclBase";
+        if (c->principals || c->groupFile || c->users || c->userFile || c->depth || c->entries)
+            return "DavAclPrincipals, DavAclGroupFile, DavAclUsers, DavAclUserFile, DavAclDepth and DavAclMaxEntries "
+                   "need a DavAclBase";
         return nullptr;
     }
     if (isWithin(c->base, c->principalBase()) || isWithin(c->principalBase(), c->base))
@@ -127,11 +146,53 @@ void* mergeConfigurations(apr_pool_t* pool, void* base, void* more) {
     if (inner->principals) merged->principals = inner->principals;
     if (inner->groupFile) merged->groupFile = inner->groupFile;
     if (inner->users) merged->users = inner->users;
+    if (inner->userFile) merged->userFile = inner->userFile;
     if (inner->depth) merged->depth = inner->depth;
+    if (inner->entries) merged->entries = inner->entries;
     return merged;
 }
 
+namespace {
+
+bool isSection(const ap_directive_t* directive, const char* name) {
+    return directive && strcasecmp(directive->directive, name) == 0;
+}
+
+// The argument of a section, "</dav>" for instance, without quotation marks and the closing bracket.
+std::string placeOf(const ap_directive_t* section) {
+    std::string place = section->args ? section->args : "";
+    std::erase_if(place, [](char c) { return c == '"' || c == '>'; });
+    while (place.size() > 1 && (place.back() == '/' || place.back() == ' ')) place.pop_back();
+    return place;
+}
+
+// Where "Dav On" holds for the directory or URL path of a section, and that lies above the trees.
+bool liesAbove(const ap_directive_t* section, const Configuration& c, const char* documentRoot) {
+    if (isSection(section, "<Location")) return isAbove(c.base, placeOf(section)) || placeOf(section) == "/";
+    if (!isSection(section, "<Directory") || !documentRoot) return false;
+    return isAbove(std::string(documentRoot) + c.base, placeOf(section));
+}
+
+void warnAboutDavAbove(const ap_directive_t* directive, const server_rec* server, const Configuration& c) {
+    const auto* core = static_cast<const core_server_config*>(ap_get_core_module_config(server->module_config));
+    for (; directive; directive = directive->next) {
+        if (strcasecmp(directive->directive, "Dav") == 0 && directive->args &&
+            strcasecmp(directive->args, "off") != 0 &&
+            (!directive->parent || isSection(directive->parent, "<VirtualHost") ||
+             liesAbove(directive->parent, c, core->ap_document_root)))
+            ap_log_error(APLOG_MARK, APLOG_STARTUP | APLOG_WARNING, 0, server,
+                         "davacl: WebDAV is on above the trees at %s (%s, line %d): switch it on at %s and below only",
+                         c.base, directive->filename, directive->line_num, c.base);
+        warnAboutDavAbove(directive->first_child, server, c);
+    }
+}
+
+} // namespace
+
 int checkConfigurations(apr_pool_t*, apr_pool_t*, apr_pool_t*, server_rec* server) {
+    for (const server_rec* each = server; each; each = each->next)
+        if (ap_state_query(AP_SQ_MAIN_STATE) != AP_SQ_MS_CREATE_PRE_CONFIG && ofServer(each)->base)
+            warnAboutDavAbove(ap_conftree, each, *ofServer(each));
     for (; server; server = server->next)
         if (const char* complaint = complaintAbout(server)) {
             ap_log_error(APLOG_MARK, APLOG_STARTUP | APLOG_ERR, 0, server, "davacl: %s", complaint);
@@ -148,6 +209,10 @@ const command_rec kDirectives[] = {
     {"DavAclGroupFile", asCommand(setGroupFile), nullptr, RSRC_CONF, TAKE1, "a group file, as for AuthGroupFile"},
     {"DavAclUsers", asCommand(addUsers), nullptr, RSRC_CONF, ITERATE,
      "authentication providers that know which users exist"},
+    {"DavAclUserFile", asCommand(setUserFile), nullptr, RSRC_CONF, TAKE1,
+     "a file with a line for each user, which begins with the name and a colon, such as AuthUserFile names"},
+    {"DavAclMaxEntries", asCommand(setMaxEntries), nullptr, RSRC_CONF, TAKE1,
+     "how many entries a list may hold: 1000 by default"},
     {"DavAclDepth", asCommand(setDepth), nullptr, RSRC_CONF, TAKE1,
      "how many segments below the base may have lists of their own: 2 by default"},
     {nullptr, nullptr, nullptr, 0, RAW_ARGS, nullptr}};

@@ -11,9 +11,12 @@ struct Configuration {
     const char* principals = nullptr;    // without a slash at the end
     const char* groupFile = nullptr;     // null: no groups
     apr_array_header_t* users = nullptr; // of const char*: the authentication providers that know who exists
+    const char* userFile = nullptr;      // null: none; who stands in it exists, and no provider is asked
+    int entries = 0;                     // the most that a list holds
     int depth = 0;                       // how many segments below the base may have lists of their own
 
     const char* principalBase() const { return principals ? principals : "/principals"; }
+    size_t mostEntries() const { return entries ? static_cast<size_t>(entries) : 1000; }
     size_t levels() const { return depth ? static_cast<size_t>(depth) : 2; }
 };
 

@@ -2,8 +2,13 @@
 
 #include "server/mod_davacl/Access.h"
 #include "server/mod_davacl/Locks.h"
+#include "server/mod_davacl/Needs.h"
 
+#include <algorithm>
 #include <cstring>
+#include <optional>
+#include <string>
+#include <vector>
 
 namespace rolvane::davacl {
 namespace {
@@ -21,14 +26,61 @@ bool isDestination(const request_rec* r) {
            (std::strcmp(r->method, "COPY") == 0 || std::strcmp(r->method, "MOVE") == 0);
 }
 
+// The trees below the base, as far as mod_dav_fs has them: the directory behind the base tells their owners. Nothing
+// when it cannot be read.
+std::optional<std::vector<std::string>> ownersOfTrees(request_rec* r, const Configuration& c) {
+    request_rec* base = ap_sub_req_lookup_uri(apr_pstrcat(r->pool, c.base, "/", nullptr), r, nullptr);
+    apr_dir_t* directory = nullptr;
+    if (!base->filename || apr_dir_open(&directory, base->filename, r->pool) != APR_SUCCESS) return std::nullopt;
+    std::vector<std::string> owners;
+    apr_finfo_t entry;
+    while (apr_dir_read(&entry, APR_FINFO_NAME, directory) == APR_SUCCESS)
+        if (const std::string name = entry.name; name != "." && name != "..") owners.push_back(name);
+    apr_dir_close(directory);
+    return owners;
+}
+
+bool mayOnEveryTree(request_rec* r, const Configuration& c, unsigned needed) {
+    const auto owners = ownersOfTrees(r, c);
+    return owners && std::all_of(owners->begin(), owners->end(), [&](const std::string& owner) {
+               return (privilegesOn(r, c, TreePath{owner, {}}) & needed) == needed;
+           });
+}
+
+// Infinity is what LOCK, COPY, MOVE and PROPFIND mean when they say nothing.
+bool isDeep(const request_rec* r) {
+    const char* depth = apr_table_get(r->headers_in, "Depth");
+    return !depth || (std::strcmp(depth, "0") != 0 && std::strcmp(depth, "1") != 0);
+}
+
+// A request may take in all trees without naming one of them.
+bool reachesIntoForeignTrees(request_rec* r, const Configuration& c, bool destination) {
+    const unsigned needed = destination ? neededOfMembersReplaced() : neededOfMembers(r->method, isDeep(r));
+    return needed && !mayOnEveryTree(r, c, needed);
+}
+
+int refuseReach(request_rec* r) {
+    if (r->main) return HTTP_FORBIDDEN;
+    dav_error* error =
+        dav_new_error_tag(r->pool, HTTP_FORBIDDEN, 0, 0,
+                          "The request takes in all trees, and one of them at least is not yours to do that with.",
+                          "DAV:", "need-privileges");
+    ap_log_rerror(APLOG_MARK, APLOG_INFO, 0, r, "davacl: %s %s takes in trees of others", r->method, r->uri);
+    ap_discard_request_body(r);
+    return dav_handle_err(r, error, nullptr);
+}
+
 int check(request_rec* r) {
     const Configuration* c = configurationOf(r);
     if (!c) return DECLINED;
     if (isAmongTheLists(r, *c)) return HTTP_FORBIDDEN;
     const auto place = TreePath::of(c->base, r->uri);
+    const bool destination = isDestination(r);
+    const bool takesInAll = place ? place->isBase() : isAbove(c->base, r->uri);
+    // Every sub-request that asks where something lies ends here, too: it is no request of its own.
+    if (takesInAll && (!r->main || destination) && reachesIntoForeignTrees(r, *c, destination)) return refuseReach(r);
     if (!place) return DECLINED;
     if (place->isReserved()) return HTTP_FORBIDDEN;
-    const bool destination = isDestination(r);
     const Standing standing = standingOf(r);
     const auto missing =
         missingOf(r, *c, *place, destination ? needsOfDestination(r->method, standing) : needsOf(r->method, standing));

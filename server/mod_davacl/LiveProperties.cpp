@@ -163,12 +163,14 @@ dav_prop_insert insertProperty(const dav_resource* resource, int property, dav_p
     });
 }
 
+// Of what is not writable mod_dav says 409; what is, it asks about, and the answer says why not.
 int isWritable(const dav_resource*, int) noexcept {
-    return 0;
+    return 1;
 }
 
 dav_error* refusePatch(const dav_resource* resource, const apr_xml_elem*, int, void**, int*) noexcept {
-    return dav_new_error_tag(resource->pool, HTTP_FORBIDDEN, 0, 0, "The property is set by the ACL method only.",
+    return dav_new_error_tag(resource->pool, HTTP_FORBIDDEN, 0, 0,
+                             "cannot-modify-protected-property: the property is computed, or set by the ACL method.",
                              "DAV:", "cannot-modify-protected-property");
 }
 

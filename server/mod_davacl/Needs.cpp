@@ -8,7 +8,7 @@ namespace {
 
 constexpr std::string_view kReaders[] = {"GET", "HEAD", "OPTIONS", "PROPFIND", "REPORT", "SEARCH"};
 constexpr unsigned kAllBits[] = {
-    kRead, kReadCurrentUserPrivilegeSet, kWriteContent, kWriteProperties, kBind, kUnbind, kReadAcl, kWriteAcl, kUnlock};
+    kRead, kReadCurrentUserPrivilegeSet, kWriteContent, kWriteProperties, kBind, kUnbind, kReadAcl, kWriteAcl};
 
 bool isReader(std::string_view method) {
     return std::find(std::begin(kReaders), std::end(kReaders), method) != std::end(kReaders);
@@ -41,6 +41,20 @@ std::vector<Need> needsOfDestination(std::string_view method, Standing standing)
     if (method == "COPY" && standing == Standing::file) return {{kWriteContent, false}, {kWriteProperties, false}};
     // What is there is removed before.
     return {{kUnbind, true}, {kBind, true}};
+}
+
+unsigned neededOfMembers(std::string_view method, bool deep) {
+    // These two are deep by themselves, whatever Depth says (RFC 4918 sections 9.6.1 and 9.9.2).
+    if (method == "DELETE") return kUnbind;
+    if (method == "MOVE") return kRead | kUnbind;
+    if (!deep) return 0;
+    if (method == "COPY" || method == "PROPFIND" || method == "REPORT") return kRead;
+    if (method == "LOCK") return kWriteContent;
+    return 0;
+}
+
+unsigned neededOfMembersReplaced() {
+    return kUnbind | kBind;
 }
 
 bool changesSomething(std::string_view method) {

@@ -22,6 +22,12 @@ std::vector<Need> needsOf(std::string_view method, Standing standing);
 // The same for the place that a Destination header names.
 std::vector<Need> needsOfDestination(std::string_view method, Standing standing);
 
+// The privileges on every tree that a request needs whose scope takes in all trees: it names the base or a place above
+// it. `deep`: its Depth is infinity, said or by default. 0: the trees are not concerned.
+unsigned neededOfMembers(std::string_view method, bool deep);
+// The same where such a place is the Destination of COPY or MOVE.
+unsigned neededOfMembersReplaced();
+
 // Whether a method changes what is stored.
 bool changesSomething(std::string_view method);
 

@@ -3,6 +3,8 @@
 #include "server/mod_davacl/GroupFile.h"
 
 #include <cstring>
+#include <set>
+#include <sstream>
 #include <vector>
 
 namespace rolvane::davacl {
@@ -17,6 +19,24 @@ bool providerKnows(request_rec* r, const char* name, const std::string& user) {
     if (!provider || !provider->check_password) return false;
     const authn_status status = provider->check_password(r, user.c_str(), kNobodysPassword);
     return status == AUTH_DENIED || status == AUTH_GRANTED || status == AUTH_USER_FOUND;
+}
+
+bool anyProviderKnows(request_rec* r, const Configuration& c, const std::string& user) {
+    for (int i = 0; i < c.users->nelts; ++i)
+        if (providerKnows(r, reinterpret_cast<const char* const*>(c.users->elts)[i], user)) return true;
+    return false;
+}
+
+// Read once a request.
+const std::set<std::string, std::less<>>& usersInFile(request_rec* r, const Configuration& c) {
+    auto& users = stateOf(r).usersInFile;
+    if (users) return *users;
+    users.emplace();
+    std::istringstream lines(fileText(c.userFile));
+    for (std::string line; std::getline(lines, line);)
+        if (const size_t colon = line.find(':'); colon != std::string::npos && line[0] != '#')
+            users->insert(line.substr(0, colon));
+    return *users;
 }
 
 // What a URL below the principals' base names.
@@ -244,10 +264,13 @@ std::string currentUserPrincipal(request_rec* r, const Configuration& c) {
 bool exists(request_rec* r, const Configuration& c, const Principal& principal) {
     if (principal.kind == Principal::Kind::authenticated) return true;
     if (principal.kind == Principal::Kind::group) return groupsIn(groupText(c)).contains(principal.name);
-    if (!c.users || principal.name == r->user) return true;
-    for (int i = 0; i < c.users->nelts; ++i)
-        if (providerKnows(r, reinterpret_cast<const char* const*>(c.users->elts)[i], principal.name)) return true;
-    return false;
+    if ((!c.users && !c.userFile) || principal.name == r->user) return true;
+    if (c.userFile && usersInFile(r, c).contains(principal.name)) return true;
+    if (!c.users) return false;
+    auto& known = stateOf(r).knownUsers;
+    const auto found = known.find(principal.name);
+    return found != known.end() ? found->second
+                                : known.emplace(principal.name, anyProviderKnows(r, c, principal.name)).first->second;
 }
 
 std::optional<Principal> principalAt(request_rec* r, const Configuration& c, const std::string& href) {

@@ -21,8 +21,7 @@ constexpr Named kParts[] = {
     {kBind, "bind", "Add members"},
     {kUnbind, "unbind", "Remove members"},
     {kReadAcl, "read-acl", "Read the access list"},
-    {kWriteAcl, "write-acl", "Change the access list"},
-    {kUnlock, "unlock", "Remove another's lock"}};
+    {kWriteAcl, "write-acl", "Change the access list"}};
 
 std::string element(const char* name) {
     return std::string("<D:privilege><D:") + name + "/></D:privilege>";
@@ -72,7 +71,7 @@ std::string supportedPrivileges() {
     return supported(kAggregates[0], true,
                      supported(kAggregates[1], false, supportedParts(kReading & ~kRead)) +
                          supported(kAggregates[2], false, supportedParts(kWriting)) +
-                         supportedParts(kReadAcl | kWriteAcl | kUnlock));
+                         supportedParts(kReadAcl | kWriteAcl));
 }
 
 } // namespace rolvane::davacl

@@ -5,7 +5,8 @@
 
 namespace rolvane::davacl {
 
-// The privileges of RFC 3744 section 3, as bits.
+// The privileges of RFC 3744 section 3, as bits. DAV:unlock, the right to remove another's lock, is missing: mod_dav
+// lets nobody but the holder of a lock give it back.
 enum Privilege : unsigned {
     kRead = 1,
     kReadCurrentUserPrivilegeSet = 2,
@@ -14,14 +15,13 @@ enum Privilege : unsigned {
     kBind = 16,
     kUnbind = 32,
     kReadAcl = 64,
-    kWriteAcl = 128,
-    kUnlock = 256
+    kWriteAcl = 128
 };
 
 // What a list can grant. Everything else is abstract: it is part of these or the owner's alone.
 inline constexpr unsigned kReading = kRead | kReadCurrentUserPrivilegeSet;
 inline constexpr unsigned kWriting = kWriteContent | kWriteProperties | kBind | kUnbind;
-inline constexpr unsigned kEverything = kReading | kWriting | kReadAcl | kWriteAcl | kUnlock;
+inline constexpr unsigned kEverything = kReading | kWriting | kReadAcl | kWriteAcl;
 
 // The element name of one bit.
 const char* privilegeName(Privilege privilege);

@@ -64,6 +64,11 @@ bool TreePath::isReserved() const {
     return isReservedSegment(owner) || std::any_of(below.begin(), below.end(), isReservedSegment);
 }
 
+bool isAbove(std::string_view base, std::string_view path) {
+    while (path.ends_with('/')) path.remove_suffix(1);
+    return path.size() < base.size() && base.starts_with(path) && base[path.size()] == '/';
+}
+
 bool isUsableName(std::string_view name) {
     return !name.empty() && name.size() <= kLongestName && name != "." && name != ".." &&
            std::none_of(name.begin(), name.end(), [](unsigned char c) { return c == '/' || c < 0x20 || c == 0x7f; });

@@ -26,6 +26,9 @@ struct TreePath {
     bool isReserved() const;
 };
 
+// Whether the path is one of those on the way down to the base, "/" for instance; the base itself is none.
+bool isAbove(std::string_view base, std::string_view path);
+
 // Whether a name can stand in a file name and in a path segment: it holds no slash, control character or line break, is
 // neither "." nor "..", and has at most 200 bytes.
 bool isUsableName(std::string_view name);

@@ -128,7 +128,7 @@ TEST(OwnersListsGrant, GroupsByMembershipAndEverybodyWhoIsSignedIn) {
 }
 
 TEST(OwnersListsGrant, NothingThatIsTheOwnersAlone) {
-    EXPECT_EQ((kReading | kWriting) & (kReadAcl | kWriteAcl | kUnlock), 0u);
+    EXPECT_EQ((kReading | kWriting) & (kReadAcl | kWriteAcl), 0u);
 }
 
 TEST(OwnersListsTrees, GoAndMoveWithEverythingBelow) {
@@ -187,8 +187,8 @@ TEST(Needs, AreThoseOfTheMethodAndWhatStandsThere) {
     EXPECT_EQ(needsOfDestination("COPY", Standing::collection), (Many{{kUnbind, true}, {kBind, true}}));
     EXPECT_EQ(needsOfDestination("COPY", Standing::nothing), (Many{{kBind, true}}));
     EXPECT_EQ(needsOf("ACL", Standing::collection), (Many{{kWriteAcl, false}}));
-    EXPECT_EQ(needsOf("NEVERHEARDOF", Standing::file).size(), 9u);
-    EXPECT_EQ(needsOf("get", Standing::file).size(), 9u) << "methods are taken to the letter";
+    EXPECT_EQ(needsOf("NEVERHEARDOF", Standing::file).size(), 8u);
+    EXPECT_EQ(needsOf("get", Standing::file).size(), 8u) << "methods are taken to the letter";
 }
 
 TEST(GroupFile, IsReadAsHttpdReadsIt) {
@@ -205,7 +205,7 @@ TEST(GroupFile, IsReadAsHttpdReadsIt) {
 TEST(Privileges, ThatAListCanGrantAreReadingAndWriting) {
     EXPECT_EQ(useOf("read"), PrivilegeUse::concrete);
     EXPECT_EQ(useOf("write"), PrivilegeUse::concrete);
-    for (const char* name : {"all", "bind", "unbind", "write-acl", "read-acl", "unlock", "write-content"})
+    for (const char* name : {"all", "bind", "unbind", "write-acl", "read-acl", "write-content"})
         EXPECT_EQ(useOf(name), PrivilegeUse::abstract) << name;
     EXPECT_EQ(useOf("fly"), PrivilegeUse::unknown);
     EXPECT_EQ(privilegeElements(0), "");

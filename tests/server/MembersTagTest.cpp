@@ -159,7 +159,7 @@ TEST(MembersTag, IsAPropertyOfCollectionsForWhomMayReadThem) {
     EXPECT_THAT(all.body, Not(HasSubstr("members-tag"))) << "costs, so it is told when it is asked for";
     const std::string patch = "<propertyupdate xmlns=\"DAV:\"><set><prop><m:members-tag "
                               "xmlns:m=\"http://rolvane.net/ns/\">mine</m:members-tag></prop></set></propertyupdate>";
-    EXPECT_THAT(world.ask("alice", "PROPPATCH", tree, {}, patch).body, HasSubstr("read-only"));
+    EXPECT_THAT(world.ask("alice", "PROPPATCH", tree, {}, patch).body, HasSubstr("cannot-modify-protected-property"));
     EXPECT_EQ(told(world, "rita", tree), settled) << "nobody sets it";
     EXPECT_EQ(world.status("alice", "PUT", tree + "new", {}, "x"), 201);
     EXPECT_EQ(told(world, "rita", tree), "") << "changed just now";

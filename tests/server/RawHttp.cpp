@@ -2,6 +2,7 @@
 
 #include "server/StoreConfiguration.h"
 
+#include <algorithm>
 #include <arpa/inet.h>
 #include <atomic>
 #include <cstdio>
@@ -63,7 +64,10 @@ void sendAll(int s, const std::string& text) {
 }
 
 std::string headOf(const RawRequest& request) {
-    std::string text = request.method + " " + request.path + " HTTP/1.1\r\nHost: localhost\r\nConnection: close\r\n";
+    std::string text = request.method + " " + request.path + " HTTP/1.1\r\nConnection: close\r\n";
+    const bool hasHost = std::any_of(request.headers.begin(), request.headers.end(),
+                                     [](const auto& header) { return header.first == "Host"; });
+    if (!hasHost) text += "Host: localhost\r\n";
     if (!request.user.empty())
         text += "Authorization: Basic " + base64(request.user + ":" + rawPasswordOf(request.user)) + "\r\n";
     for (const auto& [name, value] : request.headers) text += name + ": " + value + "\r\n";
