@@ -2,6 +2,8 @@
 
 #include "Examples.h"
 
+#include "daemon/InstanceLock.h"
+
 #include <cmath>
 #include <fmt/format.h>
 #include <iostream>
@@ -11,7 +13,7 @@ namespace rolvane::cli {
 
 struct Context::Impl {
     RunLoop* loop = nullptr;
-    std::unique_ptr<DistributedNotifications> bus;
+    std::unique_ptr<DaemonLink> bus;
     bool opened = false;
 };
 
@@ -26,8 +28,10 @@ RunLoop& Context::loop() {
     return *_impl->loop;
 }
 
-DistributedNotifications& Context::bus() {
-    if (!_impl->bus) _impl->bus = makeBusNotifications(loop());
+DaemonLink& Context::bus() {
+    if (!_impl->bus)
+        _impl->bus = std::make_unique<DaemonLink>(
+            loop(), [] { return InstanceLock::holderListensAt(InstanceLock::defaultPath()); });
     return *_impl->bus;
 }
 

@@ -2,6 +2,7 @@
 
 #include "contacts/CXRolvane.h"
 #include "foundation/CXException.h"
+#include "foundation/DaemonNotifications.h"
 
 #include <CLI/CLI.hpp>
 #include <functional>
@@ -44,8 +45,8 @@ public:
     bool quiet = false; // --quiet: no talk but errors
     int exitCode = kOk; // what the command ends with when nothing is thrown
 
-    CXRolvane& database();           // the user's contact database
-    DistributedNotifications& bus(); // the session bus; posts nothing without one
+    CXRolvane& database(); // the user's contact database
+    DaemonLink& bus();     // the session bus and the daemon's socket, as far as there are any
     RunLoop& loop();
 
     void print(const nlohmann::ordered_json& data); // one JSON document and a line end

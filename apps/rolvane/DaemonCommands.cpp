@@ -203,10 +203,10 @@ struct WatchOptions {
 };
 
 void watch(Context& context, const WatchOptions& options) {
-    if (!context.bus().connected())
-        throw CommandError(kUnreachable, "There is no session bus, so the daemon cannot be heard. Log in to a session, "
-                                         "or set DBUS_SESSION_BUS_ADDRESS.");
     PassWatch pass(context);
+    if (!DaemonControl().running())
+        context.say("RolvaneManager is not running; what it does is shown once it does. `rolvane daemon start` starts "
+                    "it.");
     Interrupt interrupt(context.loop());
     std::unique_ptr<ProgressBar> bar;
     const bool draw = context.dataIsTerminal() && context.talkIsTerminal() && !context.json;

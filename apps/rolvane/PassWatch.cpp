@@ -1,9 +1,55 @@
 #include "PassWatch.h"
 
+#include "daemon/DaemonControl.h"
+
 #include <algorithm>
-#include <chrono>
+#include <fmt/format.h>
 
 namespace rolvane::cli {
+
+namespace {
+
+using Steady = std::chrono::steady_clock;
+
+double secondsSince(Steady::time_point then) {
+    return std::chrono::duration<double>(Steady::now() - then).count();
+}
+
+} // namespace
+
+// The question that is under way has its answer.
+bool DaemonPulse::answered() {
+    return _number && _context.bus().socket().heard(*_number);
+}
+
+void DaemonPulse::check() {
+    constexpr double kAskAgain = 1;
+    const auto process = DaemonControl().running();
+    if (!process || process != _process) {
+        _process = process;
+        _number.reset();
+        _since.reset();
+        _answered.reset();
+    }
+    if (!process) return;
+    if (answered()) {
+        _number.reset();
+        _since.reset();
+        _answered = Steady::now();
+    }
+    if (!_since && _answered && secondsSince(*_answered) < kAskAgain) return;
+    if (!_since) _since = Steady::now();
+    ControlClient& socket = _context.bus().socket();
+    if (!socket.connected()) _number.reset(); // what was asked before went to a connection that has ended
+    if (!_number) _number = socket.ask();
+    if (secondsSince(*_since) < kAnswerSeconds) return;
+    _context.loop().runOnce(0); // the answer may lie there: it was this process that rested
+    if (answered()) return;
+    throw CommandError(kUnreachable, fmt::format("RolvaneManager (process {}) runs, but does not answer: it was "
+                                                 "stopped, or hangs. `rolvane daemon restart` ends it and starts it "
+                                                 "anew; nothing that was saved is lost.",
+                                                 *process));
+}
 
 PassWatch::PassWatch(Context& context, bool progress) : _context(context) {
     using Kind = Event::Kind;
@@ -32,24 +78,42 @@ PassWatch::PassWatch(Context& context, bool progress) : _context(context) {
 void PassWatch::heard(const Event& event) {
     if (event.kind == Event::Kind::started) ++_started;
     if (event.kind == Event::Kind::stopped) ++_stopped;
+    _atWork = event.kind != Event::Kind::stopped;
     // Progress comes thousands of times a second, and the test is not for free.
     if (event.kind != Event::Kind::progress) _news = true;
     if (onEvent) onEvent(event);
 }
 
 bool PassWatch::waitUntil(const std::function<bool()>& test, double seconds) {
-    using Clock = std::chrono::steady_clock;
     constexpr double kAskAgain = 0.5;
-    const auto end = Clock::now() + std::chrono::duration<double>(seconds);
-    auto asked = Clock::now();
+    const auto start = Steady::now();
+    DaemonPulse pulse(_context);
     while (!test()) {
+        pulse.check();
         _news = false;
-        asked = Clock::now();
-        while (!_news && Clock::now() - asked < std::chrono::duration<double>(kAskAgain) && Clock::now() < end)
-            _context.loop().runOnce(std::min(kAskAgain, std::chrono::duration<double>(end - Clock::now()).count()));
-        if (Clock::now() >= end) return test();
+        const auto asked = Steady::now();
+        while (!_news && secondsSince(asked) < kAskAgain && secondsSince(start) < seconds)
+            _context.loop().runOnce(std::clamp(seconds - secondsSince(start), 0.0, kAskAgain));
+        if (secondsSince(start) >= seconds) return test();
     }
     return true;
+}
+
+std::optional<bool> PassWatch::tell(const std::string& name) {
+    constexpr double kAskAgain = 0.05;
+    const DaemonControl daemon;
+    const Notification notification{name, std::nullopt, {}};
+    DaemonPulse pulse(_context);
+    ControlClient& socket = _context.bus().socket();
+    std::optional<int64_t> number;
+    while (daemon.running()) {
+        if (!socket.connected()) number.reset();
+        if (!number) number = _context.bus().postForAnswer(notification);
+        if (const auto acts = number ? socket.heard(*number) : std::nullopt) return acts;
+        pulse.check();
+        _context.loop().runOnce(kAskAgain);
+    }
+    return std::nullopt;
 }
 
 } // namespace rolvane::cli

@@ -7,6 +7,7 @@
 #include "engine/EngineState.h"
 #include "store/CXDAVManager.h"
 
+#include <chrono>
 #include <fmt/format.h>
 
 namespace rolvane::cli {
@@ -14,6 +15,7 @@ namespace rolvane::cli {
 namespace {
 
 constexpr const char* kDaemonProgram = "RolvaneManager";
+constexpr const char* kMakePass = "SimulateVaultraNotification";
 
 // A daemon that ends in the middle would be waited for in vain.
 void requireDaemon(const DaemonControl& daemon) {
@@ -61,6 +63,8 @@ void waitForPass(Context& context, PassWatch& watch, const std::string& label, i
     };
     CXRolvane& database = context.database();
     const DaemonControl daemon;
+    const auto start = std::chrono::steady_clock::now();
+    bool asked = false;
     const auto passed = [&] {
         const auto lastPass = Preferences::shared().get(kDaemonDomain, kCXDCXConduitLastSyncDate).date();
         return lastPass && *lastPass > saved && database.cursorPosition(kDaemonProgram) >= position;
@@ -69,6 +73,10 @@ void waitForPass(Context& context, PassWatch& watch, const std::string& label, i
         [&] {
             if (passed()) return true;
             requireDaemon(daemon);
+            // The daemon made no pass of the change, as of one that leads to nothing, or did not hear of it.
+            constexpr std::chrono::seconds kSilence(2);
+            if (!asked && !watch.atWork() && std::chrono::steady_clock::now() - start > kSilence)
+                asked = watch.tell(kMakePass).has_value();
             return false;
         },
         seconds);
@@ -83,27 +91,34 @@ void makePass(Context& context, double seconds) {
     const DaemonControl daemon;
     if (!daemon.running()) {
         daemon.runOnce(seconds);
-    } else {
-        PassWatch watch(context, !context.quiet);
-        if (!context.bus().post({"SimulateVaultraNotification", std::nullopt, {}}))
-            throw CommandError(kUnreachable, "There is no session bus, so the daemon cannot be asked. `rolvane daemon "
-                                             "restart` makes a pass without one.");
-        ProgressBar bar(context, "Synchronising");
-        int stoppedBefore = -1;
-        watch.onEvent = [&](const PassWatch::Event& event) {
-            if (event.kind == PassWatch::Event::Kind::progress) bar.update(event.fraction);
-            if (event.kind == PassWatch::Event::Kind::started && stoppedBefore < 0) stoppedBefore = watch.stopped();
-        };
-        const auto passed = [&] { return stoppedBefore >= 0 && watch.stopped() > stoppedBefore; };
-        const bool inVain = !watch.waitUntil([&] { return passed() || !daemon.running(); }, seconds);
-        watch.onEvent = nullptr;
-        // It was just ending, because nothing is shared any more for instance.
-        if (!inVain && !passed()) return daemon.runOnce(seconds);
-        if (inVain)
-            throw CommandError(kUnreachable, fmt::format("No pass ended within {} seconds. `rolvane daemon status` "
-                                                         "tells whether the daemon is at work.",
-                                                         seconds));
+        return;
     }
+    PassWatch watch(context, !context.quiet);
+    ProgressBar bar(context, "Synchronising");
+    int stoppedBefore = -1;
+    bool asked = false; // what was heard before belongs to another pass
+    watch.onEvent = [&](const PassWatch::Event& event) {
+        if (event.kind == PassWatch::Event::Kind::progress) bar.update(event.fraction);
+        if (asked && event.kind == PassWatch::Event::Kind::started && stoppedBefore < 0)
+            stoppedBefore = watch.stopped();
+    };
+    asked = true;
+    const auto served = watch.tell(kMakePass);
+    if (served && !*served) { // there was nothing to serve when it started
+        daemon.stop();
+        daemon.runOnce(seconds);
+        daemon.start();
+        return;
+    }
+    const auto passed = [&] { return stoppedBefore >= 0 && watch.stopped() > stoppedBefore; };
+    const bool inVain = !watch.waitUntil([&] { return passed() || !daemon.running(); }, seconds);
+    watch.onEvent = nullptr;
+    // It was just ending, because nothing is shared any more for instance.
+    if (!inVain && !passed()) return daemon.runOnce(seconds);
+    if (inVain)
+        throw CommandError(kUnreachable, fmt::format("No pass ended within {} seconds. `rolvane daemon status` tells "
+                                                     "whether the daemon is at work.",
+                                                     seconds));
 }
 
 void sync(Context& context, double seconds) {

@@ -110,7 +110,6 @@ void takeBackOnStore(const Url& base, const std::string& user, bool reading) {
 // takes nothing from the store. So the one that knows of the writer makes another pass.
 void takeInWhatWasWritten(Context& context, double seconds) {
     try {
-        if (!context.bus().connected()) DaemonControl().stop(); // it could not be asked
         makePass(context, seconds);
     } catch (const CXException& error) { // the right is taken back all the same
         context.warn(fmt::format("What was written last may be missing here: {}", error.reason()));
@@ -122,7 +121,8 @@ void carry(Context& context, PassWatch& watch, const ShareOptions& options, cons
     CXRolvane& database = context.database();
     const int64_t position = database.journalPosition();
     const Date saved = Clock::system().now();
-    if (!DaemonControl().start()) context.bus().post({kAllACLChanged, std::nullopt, {}});
+    const DaemonControl daemon;
+    if (!daemon.start() && !watch.tell(kAllACLChanged).value_or(false)) daemon.restart();
     if (options.noWait) return;
     waitForPass(context, watch, "Sharing", position, saved, options.timeout);
     const Shares shares(database);
@@ -132,7 +132,7 @@ void carry(Context& context, PassWatch& watch, const ShareOptions& options, cons
     };
     if (agrees()) return context.say("The store has it.");
     CXDAVError error;
-    if (context.bus().connected() && CXDAVManager::canReachOstrelError(error)) makePass(context, options.timeout);
+    if (CXDAVManager::canReachOstrelError(error)) makePass(context, options.timeout);
     if (agrees()) return context.say("The store has it.");
     const bool reachable = CXDAVManager::canReachOstrelError(error);
     throw CommandError(reachable ? kFailed : kUnreachable,
@@ -168,9 +168,9 @@ void changeShares(Context& context, const ShareOptions& options, bool grant) {
     PassWatch watch(context, !context.quiet);
     const bool hadWriters = !writers.empty();
     grant ? shares.grant(user, options.write) : shares.deny(user);
-    // What writers send is taken only by a daemon that knew of one when it started, and without a bus none hears of the
-    // change. It rests before the lists are saved: ended later, it would be in the middle of carrying them.
-    if (hadWriters == shares.writers().empty() || !context.bus().connected()) {
+    // What writers send is taken only by a daemon that knew of one when it started. It rests before the lists are
+    // saved: ended later, it would be in the middle of carrying them.
+    if (hadWriters == shares.writers().empty()) {
         const DaemonControl daemon;
         const bool ran = daemon.stop();
         try {

@@ -80,8 +80,7 @@ void publish(Context& context, const PublishOptions& options) {
     if (!changed) return sync(context, options.timeout);
     waitForPass(context, watch, "Publishing", position, saved, options.timeout);
     // A pass that the restart ended in the middle may have left a lock or a record behind.
-    if (pendingChanges() > 0 && context.bus().connected() && CXDAVManager::canReachOstrelError(error))
-        return sync(context, options.timeout);
+    if (pendingChanges() > 0 && CXDAVManager::canReachOstrelError(error)) return sync(context, options.timeout);
     reportPending(context);
     if (context.exitCode == kOk) context.say("Everything is on the store.");
 }

@@ -79,12 +79,12 @@ std::string amount(const Json& subscription) {
 
 // subscribe --------------------------------------------------------------------------------------------------------
 
-void startDaemonFor(Context& context, bool served) {
+void startDaemonFor(PassWatch& watch, bool served) {
     const DaemonControl daemon;
     if (!daemon.running())
         daemon.start();
-    else if (!served || !context.bus().post({kSubscriptionListChanged, std::nullopt, {}}))
-        daemon.restart(); // one that started with nothing shared hears nothing; without a bus nobody does
+    else if (!served || !watch.tell(kSubscriptionListChanged).value_or(false))
+        daemon.restart(); // one that started with nothing shared acts on nothing
 }
 
 // Waits for the pass that brings the people, and tells what came.
@@ -144,7 +144,7 @@ void subscribe(Context& context, const SubscribeOptions& options) {
     const int64_t position = database.journalPosition();
     const Date saved = Clock::system().now();
     context.say(fmt::format("You are subscribed to \"{}\" at {}.", user, location.str()));
-    if (!options.noDaemon) startDaemonFor(context, served);
+    if (!options.noDaemon) startDaemonFor(watch, served);
     if (!options.noDaemon && !options.noWait)
         waitForPeople(context, watch, location, position, saved, options.timeout);
     else if (context.json)

@@ -13,6 +13,7 @@
 #include "daemon/TerminationWatch.h"
 #include "engine/CXDSyncEngine.h"
 #include "engine/StoreFailures.h"
+#include "foundation/DaemonNotifications.h"
 #include "foundation/FreeMemory.h"
 #include "foundation/Log.h"
 #include "foundation/Paths.h"
@@ -34,11 +35,16 @@ namespace {
 // Everything that counts is durable at any moment, so the process ends at once, whatever its other threads do.
 class UnixProcessEnd : public ProcessEnd {
 public:
+    explicit UnixProcessEnd(const DaemonChannel& channel) : _channel(channel) {}
     [[noreturn]] void end(int status) override {
+        _channel.removeFile();
         sd_notify(0, "STOPPING=1");
         std::fflush(nullptr);
         ::_exit(status);
     }
+
+private:
+    const DaemonChannel& _channel;
 };
 
 // What the watch's thread may touch while the main thread is at work.
@@ -65,7 +71,7 @@ Termination& termination() {
 // The process's collaborators, made in the order in which they need each other; they live until the process ends.
 class Daemon {
 public:
-    Daemon() : _loop(RunLoop::current()), _bus(makeBusNotifications(_loop)), _progress(*_bus) {
+    Daemon() : _loop(RunLoop::current()), _channel(_loop), _progress(_channel), _processEnd(_channel) {
         _terminated = _loop.addPort(termination().event, [this](uint32_t) { terminate(); });
     }
 
@@ -78,10 +84,12 @@ public:
             if (std::strcmp(argv[i], "-p") == 0) IdleExit::process().setInterval(0);
     }
 
+    void listen(const std::string& path) { _channel.listen(path); }
+
     void openDatabase() {
         CXRolvane::Options options;
         options.program = "RolvaneManager";
-        options.distributed = _bus.get();
+        options.distributed = &_channel;
         options.runLoop = &_loop;
         CXRolvane::configureShared(options);
         CXRolvane::sharedRolvane().recoverShareCount(Preferences::shared());
@@ -101,11 +109,16 @@ public:
 
     void firstPass() {
         CXDLog("Sharing synchronization update started.");
-        CXDSyncEngine::sharedSyncEngine().bringSourcesUpToDate();
+        CXDSyncEngine& engine = CXDSyncEngine::sharedSyncEngine();
+        _channel.serve(); // the engine observes
+        engine.bringSourcesUpToDate();
         CXDLog("Sharing synchronization update completed.");
     }
 
-    void serve() { _loop.runUntil(Date::distantFuture()); }
+    void serve() {
+        _channel.serve();
+        _loop.runUntil(Date::distantFuture());
+    }
 
 private:
     std::unique_ptr<CXDSyncEngine> makeEngine() {
@@ -114,7 +127,7 @@ private:
         CXNetworkController::sharedNetworkController().startMonitoring(_loop, NotificationCenter::defaultCenter());
         _account = makeStoreNetworkAccount();
         auto engine = std::make_unique<CXDSyncEngine>(EngineCollaborators{
-            CXRolvane::sharedLocalRolvane(), Preferences::shared(), *_bus, _loop, Clock::system(), _progress,
+            CXRolvane::sharedLocalRolvane(), Preferences::shared(), _channel, _loop, Clock::system(), _progress,
             _processEnd, *_account, IdleExit::process(), [](const Url& url) { return CXWebDAVLock::initWithURL(url); },
             [this, &store](ConduitEngine& owner) { return makeConduits(owner, store); }, loginUserName(), nullptr,
             [&store] { releaseLocksOfEndedRuns(store); }, [&store] { return takeFailures(store); }});
@@ -142,7 +155,7 @@ private:
                                              Preferences::shared(),
                                              Clock::system(),
                                              NotificationCenter::defaultCenter(),
-                                             *_bus,
+                                             _channel,
                                              _alert,
                                              CXRolvane::sharedLocalRolvane(),
                                              {},
@@ -160,7 +173,7 @@ private:
     }
 
     RunLoop& _loop;
-    std::unique_ptr<DistributedNotifications> _bus;
+    DaemonChannel _channel;
     CXDProgressManager _progress;
     UnixProcessEnd _processEnd;
     DesktopAlert _alert;
@@ -176,6 +189,7 @@ int runDaemon(int argc, char** argv) {
     constexpr double kTerminationGrace = 4.5; // seconds; the promise is five
     shareHeaps();
     const TerminationWatch watch([] { termination().ask(); }, kTerminationGrace);
+    std::optional<InstanceLock> lock; // outlives the daemon, whose socket lies where the next one's will
     try {
         Daemon daemon;
         daemon.readDebugLevel();
@@ -183,12 +197,14 @@ int runDaemon(int argc, char** argv) {
         daemon.parseArguments(argc, argv);
 
         const std::string lockPath = InstanceLock::defaultPath();
-        const auto lock = InstanceLock::acquire(lockPath);
+        const std::string controlPath = controlSocketPath();
+        if (auto taken = InstanceLock::acquire(lockPath, controlPath)) lock.emplace(std::move(*taken));
         if (!lock) {
             CXLog("RolvaneManager is already running (process %d) and serves this user; this one ends.",
                   InstanceLock::holder(lockPath).value_or(0));
             return 0;
         }
+        daemon.listen(controlPath); // the lock's holder alone does
         CXDLog("Checking in with kickerd.");
         const CheckInPorts ports = CXDCheckIn(RunLoop::current());
 

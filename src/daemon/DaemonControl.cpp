@@ -225,6 +225,7 @@ bool DaemonControl::stop() const {
     if (managed()) runQuietly({"systemctl", "--user", "stop", kUnit});
     if (running() == pid && ::kill(*pid, SIGTERM) != 0 && errno != ESRCH)
         fail(fmt::format("RolvaneManager (process {}) cannot be told to end ({}).", *pid, std::strerror(errno)));
+    ::kill(*pid, SIGCONT); // one that was stopped hears of nothing else
     if (process.get() >= 0 && !waitReadable(process.get(), _options.stopSeconds))
         fail(fmt::format("RolvaneManager (process {}) did not end within {} seconds. `kill -9 {}` ends it; nothing "
                          "that was saved is lost.",

@@ -56,7 +56,7 @@ std::string InstanceLock::defaultPath() {
     return stateDirectory() + "/RolvaneManager.lock";
 }
 
-std::optional<InstanceLock> InstanceLock::acquire(const std::string& path) {
+std::optional<InstanceLock> InstanceLock::acquire(const std::string& path, const std::string& listensAt) {
     const int fd = ::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
     if (fd < 0)
         throw CXException("CXDaemonException",
@@ -64,7 +64,7 @@ std::optional<InstanceLock> InstanceLock::acquire(const std::string& path) {
                                       path, std::strerror(errno)));
     InstanceLock lock(fd);
     if (!tryLock(fd, kHeld)) return std::nullopt;
-    const std::string text = fmt::format("{}\n", ::getpid());
+    const std::string text = fmt::format("{}\n{}\n", ::getpid(), listensAt);
     if (::ftruncate(fd, 0) != 0 || ::pwrite(fd, text.data(), text.size(), 0) != static_cast<ssize_t>(text.size()) ||
         !tryLock(fd, kNamed))
         throw CXException("CXDaemonException", fmt::format("The lock file {} cannot be written ({}). Is the disk full?",
@@ -72,15 +72,29 @@ std::optional<InstanceLock> InstanceLock::acquire(const std::string& path) {
     return lock;
 }
 
-std::optional<pid_t> InstanceLock::holder(const std::string& path) {
+std::optional<std::string> InstanceLock::textOfHolder(const std::string& path) {
+    constexpr size_t kMostBytes = 8192;
     const int fd = ::open(path.c_str(), O_RDWR | O_CLOEXEC);
     if (fd < 0) return std::nullopt;
     InstanceLock probe(fd);
     if (!isHeldAndNamed(fd)) return std::nullopt;
-    char text[32] = {};
-    const ssize_t n = ::pread(fd, text, sizeof text - 1, 0);
-    const long pid = n > 0 ? std::strtol(text, nullptr, 10) : 0;
+    std::string text(kMostBytes, '\0');
+    const ssize_t n = ::pread(fd, text.data(), text.size(), 0);
+    text.resize(n > 0 ? static_cast<size_t>(n) : 0);
+    return text;
+}
+
+std::optional<pid_t> InstanceLock::holder(const std::string& path) {
+    const auto text = textOfHolder(path);
+    const long pid = text ? std::strtol(text->c_str(), nullptr, 10) : 0;
     return pid > 0 ? std::optional<pid_t>(static_cast<pid_t>(pid)) : std::nullopt;
+}
+
+std::optional<std::string> InstanceLock::holderListensAt(const std::string& path) {
+    const std::string text = textOfHolder(path).value_or("");
+    const size_t first = text.find('\n'), second = text.find('\n', first + 1);
+    if (second == std::string::npos || second == first + 1) return std::nullopt;
+    return text.substr(first + 1, second - first - 1);
 }
 
 InstanceLock::InstanceLock(InstanceLock&& other) noexcept : _fd(std::exchange(other._fd, -1)) {}

@@ -1,6 +1,6 @@
-#include "foundation/BusPoster.h"
+#include "foundation/BusNotifications.h"
+
 #include "foundation/CXException.h"
-#include "foundation/DeliveryQueue.h"
 #include "foundation/Log.h"
 #include "foundation/NotificationMessage.h"
 #include "foundation/RunLoop.h"
@@ -26,24 +26,21 @@ struct SlotCloser {
 };
 using Slot = std::unique_ptr<sd_bus_slot, SlotCloser>;
 
-struct SourceCloser {
-    void operator()(sd_event_source* source) const { sd_event_source_disable_unref(source); }
-};
-using EventSource = std::unique_ptr<sd_event_source, SourceCloser>;
-
 std::string matchRule(const std::string& name) {
     return std::string("type='signal',path='") + kNotificationPath + "',interface='" + kNotificationInterface +
            "',member='" + name + "'";
 }
 
+} // namespace
+
 // The connection that observed signals come in on: one match a name, attached to the run loop, found again when it was
 // lost. The loop's thread.
 class BusReceiver : public std::enable_shared_from_this<BusReceiver> {
 public:
-    BusReceiver(RunLoop& loop, std::optional<std::string> address) : _loop(loop), _address(std::move(address)) {}
+    BusReceiver(std::shared_ptr<LoopDelivery> delivery, std::optional<std::string> address)
+        : _delivery(std::move(delivery)), _address(std::move(address)) {}
 
     ObservationHandle observe(std::string name, NotificationHandler handler, bool coalesce);
-    void setSuspended(bool suspended);
     void end(const std::shared_ptr<DeliveryQueue::Observer>& observer);
 
 private:
@@ -53,20 +50,17 @@ private:
     bool addMatch(const std::string& name);
     void connectionLost();
     void retryLater();
-    void deliverSoon();
-    void deliverNext();
 
-    RunLoop& _loop;
+    const std::shared_ptr<LoopDelivery> _delivery;
     const std::optional<std::string> _address;
-    DeliveryQueue _queue;
-    bool _suspended = false;
-    bool _deliveryScheduled = false;
     double _retry = kFirstRetry;
     RunLoop::Handle _retryTimer;
     Bus _bus;
     Slot _filter;
     std::map<std::string, Slot> _matches; // by name
 };
+
+namespace {
 
 struct Registration : Observation {
     Registration(std::weak_ptr<BusReceiver> r, std::shared_ptr<DeliveryQueue::Observer> o)
@@ -79,9 +73,11 @@ struct Registration : Observation {
     std::shared_ptr<DeliveryQueue::Observer> observer;
 };
 
+} // namespace
+
 ObservationHandle BusReceiver::observe(std::string name, NotificationHandler handler, bool coalesce) {
     requireNotificationName(name);
-    auto observer = _queue.add(name, std::move(handler), coalesce);
+    auto observer = _delivery->queue().add(name, std::move(handler), coalesce);
     if (_bus && !_matches.contains(name)) {
         if (!addMatch(name)) connectionLost();
     } else if (!_bus && !_retryTimer) {
@@ -91,8 +87,8 @@ ObservationHandle BusReceiver::observe(std::string name, NotificationHandler han
 }
 
 void BusReceiver::end(const std::shared_ptr<DeliveryQueue::Observer>& observer) {
-    _queue.end(observer);
-    if (!_queue.observes(observer->name)) _matches.erase(observer->name);
+    _delivery->queue().end(observer);
+    if (!_delivery->queue().observes(observer->name)) _matches.erase(observer->name);
 }
 
 bool BusReceiver::addMatch(const std::string& name) {
@@ -111,9 +107,9 @@ void BusReceiver::connect() {
     sd_bus_slot* slot = nullptr;
     bool good = sd_bus_add_filter(_bus.get(), &slot, messageReceived, this) >= 0;
     _filter.reset(slot);
-    auto names = _queue.names();
+    auto names = _delivery->queue().names();
     good = good && std::all_of(names.begin(), names.end(), [&](const auto& name) { return addMatch(name); }) &&
-           sd_bus_attach_event(_bus.get(), _loop.event(), SD_EVENT_PRIORITY_NORMAL) >= 0;
+           sd_bus_attach_event(_bus.get(), _delivery->loop().event(), SD_EVENT_PRIORITY_NORMAL) >= 0;
     if (!good) return connectionLost();
     _retry = kFirstRetry;
 }
@@ -128,19 +124,18 @@ void BusReceiver::connectionLost() {
 }
 
 void BusReceiver::retryLater() {
-    if (_queue.names().empty()) return; // `observe` connects when there is something to hear
+    if (_delivery->queue().names().empty()) return; // `observe` connects when there is something to hear
     auto again = [weak = weak_from_this()] {
         if (auto self = weak.lock()) self->connect();
     };
-    _retryTimer = _loop.scheduleTimer(_retry, again);
+    _retryTimer = _delivery->loop().scheduleTimer(_retry, again);
     _retry = std::min(_retry * 2, kLongestRetry);
 }
 
 int BusReceiver::signalReceived(sd_bus_message* message, void* userdata, sd_bus_error*) {
     auto* self = static_cast<BusReceiver*>(userdata);
     try {
-        self->_queue.arrive(readNotificationMessage(message));
-        self->deliverSoon();
+        self->_delivery->arrive(readNotificationMessage(message));
     } catch (const CXException& e) {
         CXLog("A notification cannot be read: %@", e);
     }
@@ -150,75 +145,49 @@ int BusReceiver::signalReceived(sd_bus_message* message, void* userdata, sd_bus_
 int BusReceiver::messageReceived(sd_bus_message* message, void* userdata, sd_bus_error*) {
     auto* self = static_cast<BusReceiver*>(userdata);
     if (sd_bus_message_is_signal(message, "org.freedesktop.DBus.Local", "Disconnected") > 0)
-        self->_loop.performAfterDelay(0, [weak = self->weak_from_this()] {
+        self->_delivery->loop().performAfterDelay(0, [weak = self->weak_from_this()] {
             if (auto alive = weak.lock()) alive->connectionLost();
         });
     return 0;
 }
 
-void BusReceiver::setSuspended(bool suspended) {
-    _suspended = suspended;
-    deliverSoon();
+BusNotifications::BusNotifications(RunLoop& loop, const std::optional<std::string>& address)
+    : _poster(address), _delivery(std::make_shared<LoopDelivery>(loop)),
+      _receiver(std::make_shared<BusReceiver>(_delivery, address)) {
+    sd_event_source* source = nullptr;
+    if (sd_event_add_io(loop.event(), &source, _poster.queuedDescriptor(), EPOLLIN, somethingQueued, this) >= 0)
+        _queuedSource.reset(source);
+    if (sd_event_add_time_relative(loop.event(), &source, CLOCK_MONOTONIC, 0, 1000, retryElapsed, this) >= 0) {
+        _queuedRetry.reset(source);
+        sd_event_source_set_enabled(source, SD_EVENT_OFF);
+    }
 }
 
-void BusReceiver::deliverSoon() {
-    if (_suspended || _deliveryScheduled || _queue.empty()) return;
-    _deliveryScheduled = true;
-    _loop.performAfterDelay(0, [weak = weak_from_this()] {
-        if (auto self = weak.lock()) self->deliverNext();
-    });
+BusNotifications::~BusNotifications() = default;
+
+void BusNotifications::SourceCloser::operator()(sd_event_source* source) const {
+    sd_event_source_disable_unref(source);
 }
 
-// One delivery a turn: between two the loop reads what has come in, which may coalesce with what waits.
-void BusReceiver::deliverNext() {
-    _deliveryScheduled = false;
-    if (_suspended) return;
-    auto delivery = _queue.take();
-    deliverSoon(); // first, since the handler may throw
-    if (delivery && !delivery->observer->ended) delivery->observer->handler(delivery->notification);
+ObservationHandle BusNotifications::observe(std::string name, NotificationHandler handler, bool coalesce) {
+    return _receiver->observe(std::move(name), std::move(handler), coalesce);
 }
 
-class BusNotifications : public DistributedNotifications {
-public:
-    BusNotifications(RunLoop& loop, const std::optional<std::string>& address)
-        : _poster(address), _receiver(std::make_shared<BusReceiver>(loop, address)) {
-        sd_event_source* source = nullptr;
-        if (sd_event_add_io(loop.event(), &source, _poster.queuedDescriptor(), EPOLLIN, somethingQueued, this) >= 0)
-            _queuedSource.reset(source);
-        if (sd_event_add_time_relative(loop.event(), &source, CLOCK_MONOTONIC, 0, 1000, retryElapsed, this) >= 0) {
-            _queuedRetry.reset(source);
-            sd_event_source_set_enabled(source, SD_EVENT_OFF);
-        }
-    }
+int BusNotifications::somethingQueued(sd_event_source*, int, uint32_t, void* self) {
+    return static_cast<BusNotifications*>(self)->writeQueued();
+}
 
-    bool post(const Notification& notification) override { return _poster.post(notification); }
-    ObservationHandle observe(std::string name, NotificationHandler handler, bool coalesce) override {
-        return _receiver->observe(std::move(name), std::move(handler), coalesce);
-    }
-    void setSuspended(bool suspended) override { _receiver->setSuspended(suspended); }
-    bool connected() const override { return _poster.connected(); }
+int BusNotifications::retryElapsed(sd_event_source*, uint64_t, void* self) {
+    return static_cast<BusNotifications*>(self)->writeQueued();
+}
 
-private:
-    static int somethingQueued(sd_event_source*, int, uint32_t, void* self) {
-        return static_cast<BusNotifications*>(self)->writeQueued();
-    }
-    static int retryElapsed(sd_event_source*, uint64_t, void* self) {
-        return static_cast<BusNotifications*>(self)->writeQueued();
-    }
-    // In the first half of a turn, so that it happens within handlers that run the loop once, too.
-    int writeQueued() {
-        if (_poster.writeQueued()) return 0;
-        sd_event_source_set_time_relative(_queuedRetry.get(), kQueuedRetryMicroseconds);
-        sd_event_source_set_enabled(_queuedRetry.get(), SD_EVENT_ONESHOT);
-        return 0;
-    }
-
-    mutable BusPoster _poster;
-    EventSource _queuedSource, _queuedRetry;
-    std::shared_ptr<BusReceiver> _receiver;
-};
-
-} // namespace
+// In the first half of a turn, so that it happens within handlers that run the loop once, too.
+int BusNotifications::writeQueued() {
+    if (_poster.writeQueued()) return 0;
+    sd_event_source_set_time_relative(_queuedRetry.get(), kQueuedRetryMicroseconds);
+    sd_event_source_set_enabled(_queuedRetry.get(), SD_EVENT_ONESHOT);
+    return 0;
+}
 
 std::unique_ptr<DistributedNotifications> makeBusNotifications(RunLoop& loop, std::optional<std::string> address) {
     return std::make_unique<BusNotifications>(loop, address ? std::move(address) : sessionBusAddress());

@@ -1,0 +1,67 @@
+#pragma once
+
+#include "foundation/ControlMessage.h"
+#include "foundation/ControlSocket.h"
+
+#include <functional>
+#include <map>
+#include <mutex>
+#include <set>
+#include <thread>
+
+namespace rolvane {
+
+// The daemon's end of the control socket: hears what commands post, answers that it has heard, and tells them what they
+// observe. A thread of its own answers, so a command learns within a moment that the daemon lives, however long the
+// main thread is busy with a pass.
+//
+// Bounds: at most kMostPeers at a time, the next ones are let go at once; a peer that does not read loses progress
+// first (names that `mayBeDropped`), and the connection when more than kMostWaiting bytes wait for it.
+class ControlServer {
+public:
+    static constexpr size_t kMostPeers = 128;
+    static constexpr size_t kMostWaiting = size_t{4} << 20;
+    static constexpr size_t kDropsFrom = size_t{256} << 10;
+
+    struct Callbacks { // on the server's thread
+        std::function<void(const Notification&)> arrived;
+        std::function<bool(const std::string& name)> observes;       // whether anybody acts on such a notification
+        std::function<bool(const std::string& name)> mayBeDropped{}; // none: nothing may
+    };
+    // Listens when it returns. CXException when it cannot.
+    ControlServer(std::string path, Callbacks callbacks);
+    ~ControlServer(); // the socket's file goes, too
+    ControlServer(const ControlServer&) = delete;
+    ControlServer& operator=(const ControlServer&) = delete;
+
+    const std::string& path() const { return _path; }
+    // Any thread; never waits. True when a peer observes it.
+    bool post(const Notification& notification);
+    void removeFile() const; // before the process ends without running destructors; any thread
+
+private:
+    struct Peer {
+        OwnedDescriptor socket;
+        ControlReader reader;
+        std::set<std::string> observed;
+        std::string waiting; // bytes that its socket did not take yet
+        bool gone = false;
+    };
+    void serve();
+    bool accept(); // false when no descriptor is left for another peer
+    void read(Peer& peer);
+    void answer(Peer& peer, const ControlMessage& message);
+    static void write(Peer& peer, const std::string& bytes);
+    static void flush(Peer& peer);
+    void wake() const;
+
+    const std::string _path;
+    const Callbacks _callbacks;
+    OwnedDescriptor _listening, _woken;
+    std::mutex _mutex;
+    std::map<int, Peer> _peers; // guarded by _mutex, by their descriptor
+    bool _ended = false;        // guarded by _mutex
+    std::thread _thread;
+};
+
+} // namespace rolvane
