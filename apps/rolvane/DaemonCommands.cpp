@@ -204,9 +204,9 @@ struct WatchOptions {
 
 void watch(Context& context, const WatchOptions& options) {
     PassWatch pass(context);
-    if (!DaemonControl().running())
-        context.say("RolvaneManager is not running; what it does is shown once it does. `rolvane daemon start` starts "
-                    "it.");
+    const bool runs = DaemonControl().running().has_value();
+    if (!runs && options.seconds <= 0)
+        context.say("RolvaneManager is not running; it is shown once it does. `rolvane daemon start` starts it.");
     Interrupt interrupt(context.loop());
     std::unique_ptr<ProgressBar> bar;
     const bool draw = context.dataIsTerminal() && context.talkIsTerminal() && !context.json;
@@ -242,7 +242,10 @@ void watch(Context& context, const WatchOptions& options) {
     const bool ended = pass.waitUntil([&] { return interrupt.came() || (options.once && pass.stopped() > 0); },
                                       options.seconds > 0 ? options.seconds : kForever);
     if (!ended && options.once)
-        throw CommandError(kUnreachable, fmt::format("No pass ended within {} seconds.", options.seconds));
+        throw CommandError(kUnreachable, fmt::format("No pass ended within {} seconds.{}", options.seconds,
+                                                     runs ? ""
+                                                          : " RolvaneManager is not running; `rolvane daemon "
+                                                            "start` starts it."));
 }
 
 } // namespace
