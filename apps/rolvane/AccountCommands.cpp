@@ -2,7 +2,9 @@
 #include "Terminal.h"
 
 #include "daemon/DaemonControl.h"
+#include "daemon/RetrySchedule.h"
 #include "foundation/Paths.h"
+#include "foundation/Preferences.h"
 #include "store/CXDAVManager.h"
 
 #include <filesystem>
@@ -61,6 +63,12 @@ std::optional<CXDAVAccount> savedAccount() {
     return CXDAVAccount::load();
 }
 
+// The last pass has ended for that, and the daemon with it.
+bool passwordWasRefused() {
+    const auto outcome = lastOutcome(Preferences::shared());
+    return outcome && resultOf(*outcome).passwordRefused;
+}
+
 void setAccount(Context& context, CLI::App& command, const AccountOptions& options) {
     const auto given = [&](const char* option) { return command.get_option(option)->count() > 0; };
     CXDAVAccount account;
@@ -89,6 +97,9 @@ void setAccount(Context& context, CLI::App& command, const AccountOptions& optio
     if (const DaemonControl daemon; daemon.running()) {
         daemon.restart(); // it reads the account once
         context.say("RolvaneManager was started anew with it.");
+    } else if (passwordWasRefused()) {
+        daemon.start(); // the refusal has ended it
+        context.say("RolvaneManager is at work again.");
     }
     if (!formerUser.empty() && formerUser != account.user.str())
         context.say("The account's user is another one than before: the next pass starts from nothing and compares "

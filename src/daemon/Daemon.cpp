@@ -6,13 +6,16 @@
 #include "contacts/CXAllGroup.h"
 #include "contacts/CXRolvane.h"
 #include "contacts/CXUserDefaults.h"
+#include "daemon/BootTimer.h"
 #include "daemon/CXDProgressManager.h"
 #include "daemon/CheckIn.h"
 #include "daemon/DesktopAlert.h"
 #include "daemon/InstanceLock.h"
+#include "daemon/OwnPasses.h"
 #include "daemon/TerminationWatch.h"
 #include "engine/CXDSyncEngine.h"
 #include "engine/StoreFailures.h"
+#include "foundation/BootTime.h"
 #include "foundation/DaemonNotifications.h"
 #include "foundation/FreeMemory.h"
 #include "foundation/Log.h"
@@ -20,6 +23,7 @@
 #include "store/CXDAVManager.h"
 #include "store/CXNetworkController.h"
 
+#include <algorithm>
 #include <atomic>
 #include <cstdio>
 #include <cstring>
@@ -124,17 +128,75 @@ private:
     std::unique_ptr<CXDSyncEngine> makeEngine() {
         CXDAVManager& store = storeOfTheAccount();
         termination().store = &store;
-        CXNetworkController::sharedNetworkController().startMonitoring(_loop, NotificationCenter::defaultCenter());
+        makeOwnPasses(store);
         _account = makeStoreNetworkAccount();
         auto engine = std::make_unique<CXDSyncEngine>(EngineCollaborators{
             CXRolvane::sharedLocalRolvane(), Preferences::shared(), _channel, _loop, Clock::system(), _progress,
             _processEnd, *_account, IdleExit::process(), [](const Url& url) { return CXWebDAVLock::initWithURL(url); },
             [this, &store](ConduitEngine& owner) { return makeConduits(owner, store); }, loginUserName(), nullptr,
-            [&store] { releaseLocksOfEndedRuns(store); }, [&store] { return takeFailures(store); }});
+            [&store] { releaseLocksOfEndedRuns(store); }, [&store] { return takeFailures(store); },
+            [this](const PassOutcome& outcome) {
+                if (_ownPasses) _ownPasses->passEnded(resultOf(outcome));
+            }});
         _progress.setEngine(engine.get(), engine.get());
         termination().engine = engine.get();
         if (termination().asked) termination().ask(); // it came while the engine was being made
         return engine;
+    }
+
+    // The network's changes go to the network store's conduit: at once where the process ends when it is idle, else
+    // when the passes of the daemon's own have their turn.
+    void makeOwnPasses(CXDAVManager& store) {
+        CXNetworkController& network = CXNetworkController::sharedNetworkController();
+        if (IdleExit::process().interval() != IdleExit::kNever)
+            return network.startMonitoring(_loop, NotificationCenter::defaultCenter());
+        _timer.emplace(_loop, [this] { _ownPasses->wake(); });
+        _sleep.emplace(_loop, [this] { _ownPasses->networkChanged(); });
+        OwnPasses::World world;
+        world.now = secondsSinceBoot;
+        world.wakeAt = [this](std::optional<double> at) { _timer->set(at); };
+        world.lookInterval = [] { return lookInterval(); };
+        world.askStore = [&store] { return askStore(store); };
+        world.pass = [] { ownPass(); };
+        world.networkIsBack = [this] {
+            NotificationCenter::defaultCenter().post({kCXNetworkConfigurationDidChangeNotification, std::nullopt, {}});
+            return OwnPasses::Answer{!_vaultra->vaultraOffLine(), 0};
+        };
+        _ownPasses.emplace(std::move(world));
+        _networkChanged = _networkNews.observe(kCXNetworkConfigurationDidChangeNotification,
+                                               [this](const Notification&) { _ownPasses->networkChanged(); });
+        network.startMonitoring(_loop, _networkNews);
+    }
+
+    static double lookInterval() {
+        try {
+            const Value set = Preferences::shared().get(kDaemonDomain, OwnPasses::kLookIntervalKey);
+            return OwnPasses::lookIntervalOf(set.isAbsent() ? std::nullopt : std::optional(set.real()));
+        } catch (const CXException&) { // the passes tell of preferences that cannot be read
+            return OwnPasses::kLookInterval;
+        }
+    }
+
+    // A disk that is full now may have room at the next attempt.
+    static void ownPass() {
+        try {
+            CXDSyncEngine::sharedSyncEngine().bringSourcesUpToDate();
+        } catch (const CXException& exception) {
+            CXLog("A pass has failed, and is made again later: %@", exception);
+        }
+    }
+
+    // A refused password is the next pass's to tell. What failed here is no failure of that pass.
+    static OwnPasses::Answer askStore(CXDAVManager& store) {
+        const std::vector<std::string> origins = store.account().origins();
+        const std::string host = origins.empty() ? "" : Url(origins.front() + "/").host();
+        if (!CXNetworkController::sharedNetworkController().canReachAddress(host)) return {};
+        CXDAVError error;
+        const bool there = store.canReach(error) || error.code == kCXDAVErrorAuthentication;
+        OwnPasses::Answer answer{there, 0};
+        for (const PassFailure& failure : takeFailures(store))
+            answer.retryAfter = std::max(answer.retryAfter, failure.retryAfterSeconds.value_or(0));
+        return answer;
     }
 
     // An account that is there and cannot be used is not the same as none: without one, publication and subscriptions
@@ -163,8 +225,8 @@ private:
         auto cx = std::make_unique<CXDCXConduit>(engine, CXDCXConduit::World{CXRolvane::sharedLocalRolvane(),
                                                                              Preferences::shared(), Clock::system(),
                                                                              NotificationCenter::defaultCenter()});
-        CXDVaultraConduit* network = vaultra.get();
-        return {std::move(cx), std::move(vaultra), [network] { return network->vaultraOffLine(); }};
+        _vaultra = vaultra.get();
+        return {std::move(cx), std::move(vaultra), [this] { return _vaultra->vaultraOffLine(); }};
     }
 
     void terminate() {
@@ -180,6 +242,12 @@ private:
     WithdrawnContactsFolder _withdrawn;
     WithdrawalNotice _withdrawals{_withdrawn, Clock::system(), _alert};
     std::unique_ptr<NetworkAccount> _account;
+    CXDVaultraConduit* _vaultra = nullptr; // the engine's
+    NotificationCenter _networkNews;
+    ObservationHandle _networkChanged;
+    std::optional<OwnPasses> _ownPasses; // none in a process that ends when it is idle
+    std::optional<BootTimer> _timer;
+    std::optional<SleepWatch> _sleep;
     RunLoop::Handle _terminated;
 };
 

@@ -86,6 +86,14 @@ void DaemonWorld::saveAccountAt(int port) {
     _account.save();
 }
 
+void DaemonWorld::saveAccountOnPlain(int port) {
+    _account.user = UserName(kUser);
+    _account.endpoint = fmt::format("http://127.0.0.1:{}/dav/{{user}}/Contacts", port);
+    _account.secureEndpoint = fmt::format("https://127.0.0.1:{}/dav/{{user}}/Contacts", port);
+    _account.plainLoopback = true;
+    _account.save();
+}
+
 void DaemonWorld::subscribeFarAway() {
     constexpr int kNobodyListens = 1;
     saveAccountAt(kNobodyListens);

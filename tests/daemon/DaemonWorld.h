@@ -39,7 +39,8 @@ public:
     void publishEverything(); // on the account's location; the account is there before
     CXDAVAccount account() const { return _account; }
     void saveAccountOn(PrivateStore& store, const std::string& password = kPassword);
-    void saveAccountAt(int port); // of a loopback address; without a password
+    void saveAccountAt(int port);      // of a loopback address; without a password
+    void saveAccountOnPlain(int port); // the same, of a server that speaks plain http
     // An account whose store is not there, and a subscription on it: reason for a pass that has nothing to do.
     void subscribeFarAway();
     size_t pendingChanges();
