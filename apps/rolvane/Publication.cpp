@@ -7,6 +7,7 @@
 #include "contacts/SharingDates.h"
 #include "engine/EngineState.h"
 #include "engine/PublicationCache.h"
+#include "engine/RefusedChanges.h"
 #include "model/RemoteLocationMap.h"
 
 #include <algorithm>
@@ -126,6 +127,8 @@ void forgetPublication(Preferences& preferences) {
     EngineState state(preferences);
     for (const char* conduit : {kConduitCX, kConduitVaultra})
         state.conduitObjectForKey(conduit, "priorState").remove(kSelf.str());
+    state.withConduitData([](Dictionary& data) { forgetRefusedChanges(data); });
+    state.noteRefusedByOwnStore(0, std::nullopt);
     for (const char* note : {kCXDUnsavedAccessLists, kCXDUnderWay}) preferences.remove(kDaemonDomain, note);
     dropPending(state, [](const CXDChangeRecord& record) { return record.changeMadeByDataOwner(); });
     state.syncPrefs();

@@ -104,6 +104,7 @@ CXDChangeRecords CXDCXConduit::changeRecords() {
         for (const CXRecordRef& group : rolvane().recordsMatchingSearchElement(modified))
             capture.addGroup(std::dynamic_pointer_cast<CXGroup>(group));
     addUnsettledGroups(capture);
+    addUnsettledPeople(capture);
     rolvane().forEachPersonModifiedSince(ownSince, kCXPersonTable, [&](const CXRow& person) {
         if (everything || person.writer != ownProgram()) capture.addPerson(person, true);
     });
@@ -155,6 +156,22 @@ void CXDCXConduit::addUnsettledGroups(ChangeCapture& capture) {
             }
         }
         if (!isThere) capture.add(changesToRemoveGroup(cxUIDWithTableName(UniqueId(identifier), kCXGroupTable)));
+    }
+}
+
+// The owner's people whose contact the store has refused.
+void CXDCXConduit::addUnsettledPeople(ChangeCapture& capture) {
+    const Dictionary unsettled = engine().conduitObjectForKey(kConduitCX, kUnsettledPeople);
+    engine().setConduitObjectForKey(kConduitCX, Dictionary(), kUnsettledPeople);
+    for (const std::string& identifier : unsettled.allKeys()) {
+        const UniqueId uid(identifier);
+        if (const auto person = rolvane().personRow(uid)) {
+            capture.addPerson(*person, true);
+            continue;
+        }
+        auto removal = std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, CXDDeleteRecord, kSelf, uid, std::nullopt);
+        removal->setAppliesToSources(CXDSyncSourceVaultra);
+        capture.add({std::move(removal)});
     }
 }
 

@@ -137,6 +137,7 @@ private:
     bool forgetWhatIsPublishedAgain(); // true: there is something
     bool saysSomething(const CXSubscription& subscription) const;
     void addUnsettledGroups(ChangeCapture& capture);
+    void addUnsettledPeople(ChangeCapture& capture);
     const std::string& ownProgram() const;
     bool dispatch(const CXDChangeRecordPtr& record);
     // What the record names, where it is there, of the right kind and the record's to change; else null.

@@ -87,8 +87,9 @@ public:
     // Base: no.
     virtual bool swallows(const CXDChangeRecord& /*record*/) const { return false; }
 
-    // The source has refused the record, or it was given up with one that was refused: what the source holds instead
-    // counts as not seen yet, so that the next comparison offers it. Base: nothing.
+    // The source has refused a change in a copy of somebody else's contacts, or it was given up with one that was
+    // refused: what the source holds instead counts as not seen yet, so that the next comparison offers it. Base:
+    // nothing.
     virtual void wasRefused(const CXDChangeRecord& /*record*/) {}
 
     // True: this source is done with the record (applied, cancelled, or of a revoked location). An exception of the

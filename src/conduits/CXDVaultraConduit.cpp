@@ -273,6 +273,8 @@ bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state)
           isOwn ? "It is published again." : "It is left alone until its owner has mended it.");
     if (condition.kind == TreeCondition::Kind::setBack) prior.set(kTreeDates, datesToWaitFor(state));
     if (!isOwn) return false;
+    const bool isRefused = !engine().conduitObjectForKey(kConduitCX, kRefusedByStore).empty();
+    if (condition.kind == TreeCondition::Kind::lostAGroup && isRefused) return false; // it could not be written yet
     if (condition.kind == TreeCondition::Kind::lostAGroup && !looked)
         prior.set(kLookAgain, true);
     else

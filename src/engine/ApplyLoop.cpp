@@ -10,6 +10,7 @@
 #include "engine/Mingler.h"
 #include "engine/OutOfOrderWork.h"
 #include "engine/PublicationCache.h"
+#include "engine/RefusedChanges.h"
 #include "engine/UnderWay.h"
 #include "engine/UnsettledGroups.h"
 #include "foundation/CXException.h"
@@ -104,6 +105,11 @@ private:
 };
 
 } // namespace
+
+bool isGivenUp(EngineParts& parts, const CXDChangeRecord& record) {
+    const bool isOfCopy = record.initialSource() == CXDSyncSourceCX && !record.changeMadeByDataOwner();
+    return !isOfCopy && parts.denied.contains(record);
+}
 
 void saveACLs(EngineParts& parts) {
     parts.conduits.vaultra->saveACLs();
@@ -233,6 +239,14 @@ void ApplyLoop::applyOutOfOrder() {
     _outOfOrder->start(std::min(configuredWorkers(_parts.with.account), kMostWorkers));
     _outOfOrder->wait();
     _processedCount += _outOfOrder->processedCount();
+    noteRefused(); // before anything of this pass is saved
+}
+
+void ApplyLoop::noteRefused() {
+    if (_parts.denied.empty()) return;
+    _parts.state.withConduitData([&](Dictionary& data) {
+        noteRefusedChanges(data, _parts.denied.all(), _parts.denied.refused(), _parts.with.clock.now());
+    });
 }
 
 void ApplyLoop::applyInOrder() {
@@ -257,6 +271,8 @@ bool ApplyLoop::meetsOwnWaitingWrite(const CXDChangeRecord& record) {
         for (const CXDChangeRecordPtr& waiting : _outOfOrder->pending())
             if (waiting->type() == CXDUpdateRecord && waiting->initialSource() == CXDSyncSourceCX && waiting->person())
                 _waitingWrites->emplace(waiting->user().value_or(UserName()), cxNormalizedUID(*waiting->person()));
+        for (const std::string& person : _parts.state.conduitObjectForKey(kConduitCX, kUnsettledPeople).allKeys())
+            _waitingWrites->emplace(kSelf, UniqueId(person)); // refused, and to be sent again
     }
     return !_waitingWrites->empty() &&
            _waitingWrites->contains({record.user().value_or(UserName()), cxNormalizedUID(*record.person())});
@@ -313,14 +329,21 @@ void ApplyLoop::applyInOrder(const CXDChangeRecordPtr& record) {
 
 bool ApplyLoop::applyTo(CXDConduit& conduit, int32_t source, const CXDChangeRecordPtr& record) {
     if (source == CXDSyncSourceVaultra) _parts.outcomes.tried(*record);
-    if (!conduit.applyChangeRecordIfNeeded(record, &_denied)) return false;
+    if (!conduit.applyChangeRecordIfNeeded(record, &_denied)) {
+        if (_denied && source == CXDSyncSourceVaultra) _parts.denied.noteRefused(record);
+        return false;
+    }
+    if (isGivenUp(_parts, *record)) return true;
     const bool ofOwnGroup = conduit.swallows(*record) && noteSwallowed(*record);
     // Done with, but not remembered: the next comparison offers it again.
     if (!ofOwnGroup && !conduit.holds(*record)) {
         if (conduit.waitsForWhatFollows(*record)) tryAgainAtTheEnd(source, record);
         return true;
     }
-    _parts.state.withConduitData([&](Dictionary& data) { didApplyChange(data, *record, source); });
+    _parts.state.withConduitData([&](Dictionary& data) {
+        didApplyChange(data, *record, source);
+        forgetRefusedChange(data, *record);
+    });
     _parts.outcomes.applied(*record, source);
     return true;
 }
@@ -398,7 +421,7 @@ void ApplyLoop::carryOver() {
 void ApplyLoop::storeAndClose(bool allowRetry) {
     if (!_queueTaken) append(_pendingChanges, _parts.state.getPendingChanges());
     for (const CXDChangeRecordPtr& record : _parts.denied.all())
-        _parts.outcomes.refused(record->user().value_or(UserName()));
+        if (!isOwnWrite(*record)) _parts.outcomes.refused(record->user().value_or(UserName()));
     std::erase_if(_pendingChanges, [&](const CXDChangeRecordPtr& record) { return _parts.denied.contains(*record); });
     CXDLog("Pending: %@", _pendingChanges);
     CXDLog("Denied:  %@", _parts.denied.all());
@@ -408,6 +431,7 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
     // taken for the user's own addition.
     CXRolvane& rolvane = _parts.with.rolvane;
     claimState();
+    noteRefused();
     if (_inOrderDone > 0) _parts.state.intendConduitData(rolvane.historyMark());
     try {
         rolvane.save();
@@ -423,10 +447,7 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
     _end.everythingIsPublished = isPublished(*rolvane.allGroup());
     const bool lookAgain = noteUnsettled() && _pendingChanges.empty();
     _pendingChanges.clear();
-    std::vector<Refusal> refused = _parts.state.takeRefused();
-    for (const CXDChangeRecordPtr& record : _parts.denied.all())
-        refused.push_back({record->user().value_or(UserName())});
-    if (!refused.empty()) _parts.state.noteRefusedChanges(refused, _parts.with.clock.now());
+    tellRefused();
     if (!_parts.denied.empty() || lookAgain) {
         _parts.denied.clear();
         if (allowRetry) _actions.scheduleRetry();
@@ -435,11 +456,30 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
     _parts.conduits.vaultra->close();
 }
 
+void ApplyLoop::tellRefused() {
+    const Date now = _parts.with.clock.now();
+    std::vector<Refusal> refused = _parts.state.takeRefused();
+    bool ofOwn = false;
+    for (const CXDChangeRecordPtr& record : _parts.denied.all())
+        if (isOwnWrite(*record))
+            ofOwn = true;
+        else
+            refused.push_back({record->user().value_or(UserName())});
+    if (!refused.empty()) _parts.state.noteRefusedChanges(refused, now);
+    size_t waiting = 0;
+    _parts.state.withConduitData([&](Dictionary& data) {
+        if (!ofOwn) settleRefusedChanges(data, now);
+        if (hasRefusedChanges(data)) waiting = countRefusedChanges(data);
+    });
+    _parts.outcomes.rests(kSelf, static_cast<int64_t>(waiting));
+    _parts.state.noteRefusedByOwnStore(waiting, ofOwn ? std::optional(now) : std::nullopt);
+}
+
 // What another user's store has refused is undone in the copy: contacts are read again, and a group counts as changed
 // there, so that the next comparison finds the store without the change.
 void ApplyLoop::takeBack(const CXDChangeRecord& record) {
-    _parts.conduits.vaultra->wasRefused(record);
     if (record.initialSource() != CXDSyncSourceCX || record.changeMadeByDataOwner() || !record.user()) return;
+    _parts.conduits.vaultra->wasRefused(record);
     if (!record.group()) return;
     _parts.state.withConduitData([&](Dictionary& data) {
         const Dictionary groups =

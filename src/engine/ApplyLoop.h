@@ -46,6 +46,7 @@ private:
     void split();
     void noteUnderWay();
     void applyOutOfOrder();
+    void noteRefused();
     void applyInOrder();
     void applyInOrder(const CXDChangeRecordPtr& record);
     void noteArrivals();
@@ -57,6 +58,7 @@ private:
     void cleanUp();
     void carryOver();
     void storeAndClose(bool allowRetry);
+    void tellRefused();
     void takeBack(const CXDChangeRecord& record);
     void noteUnsure(const UniqueId& group); // one of the owner's
     bool noteUnsettled();
@@ -83,6 +85,10 @@ private:
     std::optional<std::set<UserName>> _refusedUsers; // whose store has refused something to the workers
     size_t _totalCount = 0, _processedCount = 0;
 };
+
+// Is the record cancelled with a refused one, so that no source holds what it says? Not of changes in copies of
+// somebody else's contacts: those count as made there, and the next comparison undoes them in the copy.
+bool isGivenUp(EngineParts& parts, const CXDChangeRecord& record);
 
 // saveACLs: the network store's lists, then the contact database's.
 void saveACLs(EngineParts& parts);

@@ -6,6 +6,7 @@
 #include "engine/EngineParts.h"
 #include "engine/PayloadMerging.h"
 #include "engine/PublicationCache.h"
+#include "engine/RefusedChanges.h"
 #include "foundation/CXException.h"
 #include "foundation/FreeMemory.h"
 #include "foundation/Log.h"
@@ -224,6 +225,8 @@ CXDChangeRecords CXDSyncEngine::gather() {
         _parts->outcomes.caught(e.reason());
         unlockAllURLs();
     }
+    _parts->state.withConduitData(
+        [&](Dictionary& data) { holdBackRefusedChanges(data, gathered, _parts->with.clock.now()); });
     return gathered;
 }
 
@@ -298,6 +301,7 @@ void CXDSyncEngine::setPendingChanges(const CXDChangeRecords& records) {
     _parts->state.setPendingChanges(records);
 }
 bool CXDSyncEngine::hasPendingChanges(const UserName& user, int32_t source) {
+    if (user == kSelf && source == CXDSyncSourceVaultra && hasRefusedChanges(conduitData())) return true;
     const CXDChangeRecords pending = getPendingChanges();
     return std::any_of(pending.begin(), pending.end(), [&](const CXDChangeRecordPtr& record) {
         return record->user() == user && (record->appliesToSources() & source) != 0;

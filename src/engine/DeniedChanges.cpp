@@ -15,6 +15,16 @@ void DeniedChanges::cancelLike(const CXDChangeRecordPtr& denied, const CXDChange
         if (change->user() == denied->user()) _records.insert(change);
 }
 
+void DeniedChanges::noteRefused(const CXDChangeRecordPtr& record) {
+    const std::lock_guard guard(_lock);
+    _refused.push_back(record);
+}
+
+CXDChangeRecords DeniedChanges::refused() const {
+    const std::lock_guard guard(_lock);
+    return _refused;
+}
+
 bool DeniedChanges::contains(const CXDChangeRecord& record) const {
     const std::lock_guard guard(_lock);
     if (_records.empty()) return false;
@@ -31,6 +41,7 @@ bool DeniedChanges::empty() const {
 void DeniedChanges::clear() {
     const std::lock_guard guard(_lock);
     _records.clear();
+    _refused.clear();
 }
 
 CXDChangeRecords DeniedChanges::all() const {

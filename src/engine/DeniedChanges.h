@@ -16,6 +16,9 @@ public:
     // cancelPendingChangesLike:amongstChanges:: the record, and every record of the same user. Records without a user
     // are like no other. `changes` must not change meanwhile.
     void cancelLike(const CXDChangeRecordPtr& denied, const CXDChangeRecords& changes);
+    // A record that the store itself has refused, and not one that is cancelled with it.
+    void noteRefused(const CXDChangeRecordPtr& record);
+    CXDChangeRecords refused() const;
     bool contains(const CXDChangeRecord& record) const; // by record equality
     bool empty() const;
     void clear();
@@ -23,7 +26,8 @@ public:
 
 private:
     mutable std::mutex _lock;
-    std::unordered_set<CXDChangeRecordPtr, RecordHash, RecordEqual> _records; // guarded by _lock
+    std::unordered_set<CXDChangeRecordPtr, RecordHash, RecordEqual> _records; // guarded by _lock, as is
+    CXDChangeRecords _refused;
 };
 
 } // namespace rolvane

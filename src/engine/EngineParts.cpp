@@ -2,6 +2,7 @@
 
 #include "contacts/CXRolvane.h"
 #include "engine/Arrivals.h"
+#include "engine/RefusedChanges.h"
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
 #include "model/PayloadKeys.h"
@@ -142,6 +143,7 @@ void updateStateAndExitIfNeeded(EngineParts& parts) {
     if (!publishes) {
         parts.state.conduitObjectForKey(kConduitCX, kPriorState).remove(kSelf.str());
         parts.state.conduitObjectForKey(kConduitVaultra, kPriorState).remove(kSelf.str());
+        parts.state.withConduitData([](Dictionary& data) { forgetRefusedChanges(data); });
         parts.state.syncPrefs();
     }
     removeCacheDataForConduit(parts, *parts.conduits.vaultra);

@@ -1,5 +1,6 @@
 #include "engine/EngineState.h"
 
+#include "engine/RefusedChanges.h"
 #include "foundation/CXException.h"
 #include "foundation/KeyedArchive.h"
 #include "foundation/Log.h"
@@ -150,6 +151,25 @@ void EngineState::noteRefusedChanges(const std::vector<Refusal>& refusals, Date 
     _preferences.set(kDaemonDomain, kCXDRefusedChanges, notes);
 }
 
+void EngineState::noteRefusedByOwnStore(size_t changes, std::optional<Date> when) {
+    const Array before = _preferences.get(kDaemonDomain, kCXDRefusedChanges).array();
+    Array notes;
+    Value since = when ? Value(*when) : Value();
+    for (const Value& note : before) {
+        const Dictionary of = note.dictionary();
+        if (of[kRefusedWhy] != Value(kRefusedByOwnStore))
+            notes.append(note);
+        else if (!when)
+            since = of[kRefusedDate];
+    }
+    if (changes > 0 && since)
+        notes.append(Dictionary{{kRefusedDate, since},
+                                {kRefusedUser, kSelf},
+                                {kRefusedChanges, static_cast<int64_t>(changes)},
+                                {kRefusedWhy, kRefusedByOwnStore}});
+    if (notes != before) _preferences.set(kDaemonDomain, kCXDRefusedChanges, notes);
+}
+
 void EngineState::noteRefused(const Refusal& refusal) {
     const std::lock_guard guard(_lock);
     _refused.push_back(refusal);
@@ -200,6 +220,10 @@ bool EngineState::isOfFormerSubscription(const RemoteLocation& location, const U
 }
 
 void EngineState::forgetUser(const UserName& user) {
+    if (user == kSelf) {
+        withConduitData([](Dictionary& data) { forgetRefusedChanges(data); });
+        noteRefusedByOwnStore(0, std::nullopt);
+    }
     for (const char* conduit : {kConduitVaultra, kConduitCX})
         conduitObjectForKey(conduit, kPriorState).remove(user.str());
     CXDChangeRecords pending = getPendingChanges();

@@ -70,6 +70,9 @@ public:
 
     // Adds what a pass was refused; the oldest are forgotten. Without synchronising.
     void noteRefusedChanges(const std::vector<Refusal>& refusals, Date when);
+    // The one note of the owner's own changes that the owner's store refuses, as long as it does: how many they are,
+    // and none when there are none. `when`: the date of a new refusal. Without synchronising.
+    void noteRefusedByOwnStore(size_t changes, std::optional<Date> when);
     // What a pass meets on its way, for that note. Any thread; in memory only.
     void noteRefused(const Refusal& refusal);
     std::vector<Refusal> takeRefused();

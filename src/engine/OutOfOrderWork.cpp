@@ -1,6 +1,8 @@
 #include "engine/OutOfOrderWork.h"
 
+#include "engine/ApplyLoop.h"
 #include "engine/PublicationCache.h"
+#include "engine/RefusedChanges.h"
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
 
@@ -122,10 +124,17 @@ int32_t OutOfOrderWork::apply(const CXDChangeRecordPtr& record, bool& denied) {
 
 bool OutOfOrderWork::applyTo(CXDConduit& conduit, int32_t source, const CXDChangeRecordPtr& record, bool& denied) {
     if (source == CXDSyncSourceVaultra) _parts.outcomes.tried(*record);
-    if (!conduit.applyChangeRecordIfNeeded(record, &denied)) return false;
+    if (!conduit.applyChangeRecordIfNeeded(record, &denied)) {
+        if (denied && source == CXDSyncSourceVaultra) _parts.denied.noteRefused(record);
+        return false;
+    }
+    if (isGivenUp(_parts, *record)) return true;
     _parts.outcomes.applied(*record, source);
     const std::lock_guard guard(_processedChangesLock);
-    _parts.state.withConduitData([&](Dictionary& data) { didApplyChange(data, *record, source); });
+    _parts.state.withConduitData([&](Dictionary& data) {
+        didApplyChange(data, *record, source);
+        forgetRefusedChange(data, *record);
+    });
     return true;
 }
 

@@ -53,6 +53,11 @@ void OutcomeKeeper::refused(const UserName& user) {
     ++_facts.counts[user].refused;
 }
 
+void OutcomeKeeper::rests(const UserName& user, int64_t changes) {
+    const std::lock_guard guard(_lock);
+    _facts.counts[user].resting = changes;
+}
+
 void OutcomeKeeper::leaves(const CXDChangeRecords& pending) {
     const std::lock_guard guard(_lock);
     countLeftOver(_facts, pending);

@@ -32,6 +32,8 @@ public:
     void applied(const CXDChangeRecord& record, int32_t source);
     void tried(const CXDChangeRecord& record);
     void refused(const UserName& user);
+    // How many changes a store has refused, in this pass or earlier, that are to be made anew later.
+    void rests(const UserName& user, int64_t changes);
     // What waits after the pass. Once a pass.
     void leaves(const CXDChangeRecords& pending);
     void caught(const std::string& exception); // the first one counts. Any thread.

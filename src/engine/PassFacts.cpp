@@ -88,7 +88,8 @@ PassOutcome outcomeOf(const PassFacts& facts, const std::optional<PassOutcome>& 
         tree.out.reached = tree.out.asked && facts.storeReached;
         tree.out.carried = counts.sent;
         tree.out.waiting = counts.toSend;
-        tree.out.refused = counts.refused + (facts.retry && known ? known->out.refused : 0);
+        tree.out.refused = counts.refused + counts.resting;
+        if (facts.retry && known && counts.resting == 0) tree.out.refused += known->out.refused;
         const bool outInStep = counts.toSend == 0 && tree.out.refused == 0 && !tree.listsWait;
         date(tree.out, outInStep, known ? &known->out : nullptr, ended);
         if (!outInStep) tree.out.why = reason(facts, tree.location, false);

@@ -16,6 +16,7 @@ struct PassFacts {
     struct Counts {
         int64_t sent = 0, received = 0; // applied to the store, or to the database
         int64_t refused = 0;
+        int64_t resting = 0;               // refused, in this pass or earlier, and to be made anew later
         int64_t toSend = 0, toReceive = 0; // left over
         bool toldToSend = false;           // the pass tried to send something there
     };

@@ -28,11 +28,6 @@ Dictionary knownGroups(const Dictionary& conduitData) {
     return conduitData[kConduitVaultra].dictionary()[kPriorState].dictionary()[kSelf.str()].dictionary();
 }
 
-bool isOwnWrite(const CXDChangeRecord& record) {
-    return record.initialSource() == CXDSyncSourceCX && record.changeMadeByDataOwner() &&
-           (record.appliesToSources() & CXDSyncSourceVaultra) != 0;
-}
-
 std::string shared(const UniqueId& uid, std::string_view table) {
     return cxUIDWithTableName(uid, table).str();
 }
@@ -192,6 +187,11 @@ void addUnlisted(Dictionary& left, const Dictionary& underWay, const Dictionary&
 }
 
 } // namespace
+
+bool isOwnWrite(const CXDChangeRecord& record) {
+    return record.initialSource() == CXDSyncSourceCX && record.changeMadeByDataOwner() &&
+           (record.appliesToSources() & CXDSyncSourceVaultra) != 0;
+}
 
 Dictionary underWay(const CXDChangeRecords& records) {
     Dictionary all;

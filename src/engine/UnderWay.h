@@ -35,7 +35,8 @@ struct PassEnd {
     bool everythingIsPublished = false;        // and not single groups only
 };
 std::unordered_set<UniqueId> removedBy(const CXDChangeRecords& records);
-CXDChangeRecords ownWrites(const CXDChangeRecords& records); // the owner's, to the network store
+bool isOwnWrite(const CXDChangeRecord& record); // of the owner's, to the network store
+CXDChangeRecords ownWrites(const CXDChangeRecords& records);
 std::unordered_set<UniqueId> groupsOf(const CXDChangeRecords& ownWrites);
 
 // What of it the next pass is to look at again, because no comparison would: what the pass was to do to the groups of

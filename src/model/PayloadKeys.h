@@ -24,6 +24,11 @@ inline constexpr const char* kPriorState = "priorState";
 // Beside it, for the contact database: identifier -> true, groups that the next scan compares whatever their date, or
 // withdraws when they are gone.
 inline constexpr const char* kUnsettledGroups = "unsettledGroups";
+// identifier -> true, the owner's people whose contact the store has refused: the next scan sends them whatever their
+// date, or has them removed from the store when they are gone.
+inline constexpr const char* kUnsettledPeople = "unsettledPeople";
+// How long what the owner's store has refused rests: see engine/RefusedChanges.h.
+inline constexpr const char* kRefusedByStore = "refusedByStore";
 // And: owner marker -> false when the owner's published tree has lost what it held, so that the next scan takes
 // everything for new; true from that scan on until all of it is written.
 inline constexpr const char* kPublishAgain = "publishAgain";

@@ -50,6 +50,12 @@ struct Told : UserAlert {
     std::vector<Text> told;
 };
 
+// The system's clock, ahead by as much as the test says.
+struct ClockAhead : Clock {
+    Date now() const override { return Clock::system().now().addingSeconds(ahead); }
+    double ahead = 0; // seconds
+};
+
 struct NoProgress : ProgressReporter {
     void startedPhase(int32_t) override {}
     void willProcessChangeRecord(const CXDChangeRecordPtr&) override {}
@@ -80,7 +86,7 @@ public:
             CXRolvane::Options{.path = directory / "contacts.db", .program = "RolvaneManager", .center = &center});
         pendingEngine = [this] {
             engine = std::make_unique<CXDSyncEngine>(
-                EngineCollaborators{*database, preferences, distributed, loop, Clock::system(), progress, processEnd,
+                EngineCollaborators{*database, preferences, distributed, loop, clock, progress, processEnd,
                                     account, idleExit, [this](const Url& url) { return makeStoreLock(manager, url); },
                                     [this](ConduitEngine& owner) { return conduits(owner); }, name + "login", nullptr});
         };
@@ -181,6 +187,7 @@ public:
     LocalNotifications distributed;
     Preferences preferences{directory / "preferences.db"};
     RunLoop loop;
+    ClockAhead clock; // the engine's
     NoProgress progress;
     ThrowingEnd processEnd;
     FakeAccount account;
