@@ -86,6 +86,10 @@ std::string refusalReason(const Json& record) {
     }
     if (record["why"] == kRefusedForItsName)
         return "the store keeps files of its own under that identifier. The change stays in this database.";
+    if (record["why"] == kRefusedByOwnStore)
+        return "the store does not let you write in your own tree. Nothing of it is lost here, and it is sent again "
+               "until "
+               "the store takes it. Ask the store's administrator to let you write there.";
     const std::string advice =
         user == kSelf.str()
             ? "Have the store's administrator let you write in your tree, then edit again."

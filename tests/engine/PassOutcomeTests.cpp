@@ -142,6 +142,9 @@ TEST_F(PassOutcomes, ARefusalIsToldByTheRetryToo) {
     EXPECT_FALSE(stored().anotherFollows);
     EXPECT_FALSE(everythingIsUpToDate(stored()));
     world.engine->bringSourcesUpToDate();
+    EXPECT_EQ(stored().trees[0].out.refused, 1) << "the owner's own stands there until the store has taken it";
+    world.clock.advance(60);
+    world.engine->applyChangeRecords({update("x")});
     EXPECT_EQ(stored().trees[0].out.refused, 0);
 }
 
