@@ -46,7 +46,8 @@ public:
                                        const UniqueId& /*group*/) {
         return {};
     }
-    // Whether changes of the user's wait for the source, in the stored queue or because it has refused them. Reads the whole queue.
+    // Whether changes of the user's wait for the source, in the stored queue or because it has refused them. Reads the
+    // whole queue.
     virtual bool hasPendingChanges(const UserName& /*user*/, int32_t /*source*/) { return false; }
 
     virtual void updateStateAndExitIfNeeded() = 0;

@@ -86,8 +86,8 @@ public:
             CXRolvane::Options{.path = directory / "contacts.db", .program = "RolvaneManager", .center = &center});
         pendingEngine = [this] {
             engine = std::make_unique<CXDSyncEngine>(
-                EngineCollaborators{*database, preferences, distributed, loop, clock, progress, processEnd,
-                                    account, idleExit, [this](const Url& url) { return makeStoreLock(manager, url); },
+                EngineCollaborators{*database, preferences, distributed, loop, clock, progress, processEnd, account,
+                                    idleExit, [this](const Url& url) { return makeStoreLock(manager, url); },
                                     [this](ConduitEngine& owner) { return conduits(owner); }, name + "login", nullptr});
         };
     }
