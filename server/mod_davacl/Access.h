@@ -9,6 +9,7 @@
 #include <optional>
 #include <set>
 #include <string>
+#include <utility>
 #include <vector>
 
 namespace rolvane::davacl {
@@ -25,6 +26,8 @@ struct RequestState {
     std::map<std::string, std::optional<OwnersLists>> lists; // by owner; nothing: damaged
     std::string grantedTo;                                   // the user of the next
     std::map<std::string, OwnersLists::Granted> granted;     // by owner
+    std::map<std::pair<std::string, std::string>, std::string>
+        entries; // of DAV:acl, by list and where it is shown from
     std::optional<std::set<std::string, std::less<>>> usersInFile;
     std::map<std::string, bool, std::less<>> knownUsers; // as the providers said
     std::optional<Missing> destinationLacks;             // why the sub-request for a Destination was refused

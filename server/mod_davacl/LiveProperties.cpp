@@ -70,15 +70,25 @@ std::vector<TreePath> ancestorsOf(const Asked& a) {
     return above;
 }
 
-std::string wholeList(const Asked& a) {
+// The entries of the list at a tree, made once a request: in a listing each member shows those of the places above it,
+// and a copy for each member would take memory in proportion to members times entries.
+const std::string& sharedEntriesOf(const Asked& a, const std::string& tree, const std::string& inheritedFrom) {
+    auto& known = stateOf(a.r).entries;
+    const auto key = std::make_pair(a.place.owner + "/" + tree, inheritedFrom);
+    const auto found = known.find(key);
+    return found != known.end() ? found->second : known.emplace(key, entriesOf(a, tree, inheritedFrom)).first->second;
+}
+
+// The list in pieces, which live as long as the request.
+void appendWholeList(const Asked& a, apr_pool_t* pool, apr_text_header* text) {
     const auto above = ancestorsOf(a);
-    const auto from = [&](const TreePath& place) { return hrefOf(a.r, a.c, place); };
     const bool hasOwn = a.place.levels() <= a.c.levels();
-    std::string text = entryOf("<D:property><D:owner/></D:property>", "<D:privilege><D:all/></D:privilege>", true,
-                               hasOwn || above.empty() ? std::string() : from(above.front()));
-    if (hasOwn) text += entriesOf(a, a.place.tree(), {});
-    for (const TreePath& place : above) text += entriesOf(a, place.tree(), from(place));
-    return text;
+    const std::string owners = entryOf("<D:property><D:owner/></D:property>", "<D:privilege><D:all/></D:privilege>",
+                                       true, hasOwn || above.empty() ? std::string() : hrefOf(a.r, a.c, above.front()));
+    apr_text_append(pool, text, apr_pstrdup(pool, owners.c_str()));
+    if (hasOwn) apr_text_append(pool, text, sharedEntriesOf(a, a.place.tree(), {}).c_str());
+    for (const TreePath& place : above)
+        apr_text_append(pool, text, sharedEntriesOf(a, place.tree(), hrefOf(a.r, a.c, place)).c_str());
 }
 
 // Whether what is served there are files, as mod_dav_fs has them.
@@ -119,9 +129,6 @@ std::optional<std::string> valueOf(const Asked& a, int property) {
     case kCurrentUserPrivilegeSet:
         if (!(mine & kReadCurrentUserPrivilegeSet)) return std::nullopt;
         return privilegeElements(mine);
-    case kAcl:
-        if (a.place.isBase() || !(mine & kReadAcl)) return std::nullopt;
-        return wholeList(a);
     case kAclRestrictions: return "<D:grant-only/><D:no-invert/>";
     case kInheritedAclSet: {
         std::string text;
@@ -154,6 +161,13 @@ dav_prop_insert insertProperty(const dav_resource* resource, int property, dav_p
                   kNamespaces[spec->ns] + "\"/>\n";
         if (what == DAV_PROP_INSERT_VALUE) {
             const Asked asked{r, *c, *place};
+            if (property == kAcl) {
+                if (place->isBase() || !(privilegesOn(r, *c, *place) & kReadAcl)) return DAV_PROP_INSERT_NOTDEF;
+                apr_text_append(resource->pool, text, "<D:acl>");
+                appendWholeList(asked, resource->pool, text);
+                apr_text_append(resource->pool, text, "</D:acl>\n");
+                return what;
+            }
             const auto value = property == kMembersTag ? tagOf(asked, resource) : valueOf(asked, property);
             if (!value) return DAV_PROP_INSERT_NOTDEF;
             out = "<" + start + ">" + *value + "</" + name + ">\n";

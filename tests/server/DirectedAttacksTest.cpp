@@ -1,11 +1,13 @@
 #include "AccessWorld.h"
 #include "foundation/Paths.h"
+#include "server/StoreProcess.h"
 
 #include <chrono>
 #include <filesystem>
 #include <fstream>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <sstream>
 #include <sys/stat.h>
 
 // Attacks that took a way around the rule, each of which got through once.
@@ -228,6 +230,38 @@ TEST(DirectedAttacks, WhetherAUserExistsCostsNoPasswordCheck) {
     EXPECT_EQ(world.ask("alice", "ACL", "/dav/alice/Contacts/", {}, AccessWorld::acl(grantTo("nobody-there", "read")))
                   .precondition(),
               "recognized-principal");
+}
+
+// The most memory that any process of the store's httpd has used so far, in megabytes.
+long mostMemory(const AccessWorld& world) {
+    long most = 0;
+    for (const auto& process : StoreProcess::findAll(world.store.stateDirectory() + "/conf/httpd.conf")) {
+        std::istringstream lines(readFile("/proc/" + std::to_string(process.pid()) + "/status"));
+        for (std::string line; std::getline(lines, line);)
+            if (line.starts_with("VmHWM:")) most = std::max(most, std::atol(line.c_str() + 6) / 1024);
+    }
+    return most;
+}
+
+TEST(DirectedAttacks, AListingWithListsTakesNoMemoryForMembersTimesEntries) {
+    const AccessWorld world;
+    world.reset();
+    std::ofstream list(world.listFile("alice"));
+    list << "davacl 1\n";
+    for (int i = 0; i < 1000; ++i) list << "/Contacts r user somebody-with-a-long-name-" << i << "\n";
+    list << "end\n";
+    list.close();
+    const std::string directory = world.store.userDirectory("alice") + "/Contacts/People/many";
+    std::filesystem::create_directory(directory);
+    for (int i = 0; i < 500; ++i) std::ofstream(directory + "/" + std::to_string(i)) << "x";
+    ASSERT_EQ(::system(("chown -R --reference=" + world.store.userDirectory("alice") + " " + directory).c_str()), 0);
+    const long before = mostMemory(world);
+    const RawAnswer answer = world.ask("alice", "PROPFIND", "/dav/alice/Contacts/People/many/", {{"Depth", "1"}},
+                                       AccessWorld::propfind("acl"));
+    ASSERT_EQ(answer.status, 207);
+    EXPECT_GT(answer.body.size(), 50'000'000u) << "each member shows the whole list";
+    EXPECT_THAT(answer.body.substr(answer.body.size() - 200'000), HasSubstr("somebody-with-a-long-name-999"));
+    EXPECT_LT(mostMemory(world) - before, 40) << "megabytes";
 }
 
 } // namespace
