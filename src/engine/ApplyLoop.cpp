@@ -20,17 +20,12 @@
 #include "store/CXFileManager.h"
 
 #include <algorithm>
-#include <charconv>
 #include <iterator>
 #include <utility>
 
 namespace rolvane {
 
 namespace {
-
-constexpr const char* kThreadCountKey = "CXDThreadCountKey";
-constexpr int64_t kDefaultWorkers = 3;
-constexpr int64_t kMostWorkers = 10;
 
 void append(CXDChangeRecords& to, CXDChangeRecords&& from) {
     to.insert(to.end(), std::make_move_iterator(from.begin()), std::make_move_iterator(from.end()));
@@ -40,16 +35,6 @@ CXDChangeRecords mingled(const CXDChangeRecords& input) {
     Mingler mingler;
     mingler.mingle(input);
     return mingler.takeMingled();
-}
-
-// A number, or a text that is one.
-int64_t configuredWorkers(const NetworkAccount& account) {
-    const Value configured = account.configValueForKey(kThreadCountKey, kDefaultWorkers);
-    const std::string* text = configured.stringIf();
-    if (!text) return configured.integer(kDefaultWorkers);
-    int64_t workers = kDefaultWorkers;
-    const auto [end, error] = std::from_chars(text->data(), text->data() + text->size(), workers);
-    return error == std::errc() && end == text->data() + text->size() ? workers : kDefaultWorkers;
 }
 
 // Without what waits for other trees, which have groups of the same names, and for sources that no pass writes to.
@@ -236,7 +221,7 @@ void ApplyLoop::noteUnderWay() {
 }
 
 void ApplyLoop::applyOutOfOrder() {
-    _outOfOrder->start(std::min(configuredWorkers(_parts.with.account), kMostWorkers));
+    _outOfOrder->start(configuredWorkers(_parts.with.account));
     _outOfOrder->wait();
     _processedCount += _outOfOrder->processedCount();
     noteRefused(); // before anything of this pass is saved

@@ -151,7 +151,7 @@ private:
 // What a long bucket is searched by.
 class Mingler::Index {
 public:
-    Index(const List& list, Elements& elements) : _list(list), _elements(elements) {}
+    Index(const List& list, Elements& elements, size_t& looks) : _list(list), _elements(elements), _looks(looks) {}
 
     void add(uint32_t element) {
         _equal.add(_elements[element].hash, element);
@@ -163,6 +163,7 @@ public:
 
     uint32_t findEqual(const CXDChangeRecord& record, uint32_t hash) const {
         return _equal.find(hash, [&](uint32_t element) {
+            ++_looks;
             return _elements[element].record != kNone && recordOf(element).isEqual(record);
         });
     }
@@ -205,6 +206,7 @@ private:
     void collect(std::vector<uint32_t>& elements, uint32_t stop, bool all, std::vector<uint32_t>& found) {
         while (!elements.empty() && _elements[elements.back()].record == kNone) elements.pop_back();
         for (auto it = elements.rbegin(); it != elements.rend() && (stop == kNone || *it > stop); ++it) {
+            ++_looks;
             if (_elements[*it].record == kNone) continue;
             found.push_back(*it);
             if (!all) return;
@@ -229,6 +231,7 @@ private:
 
     const List& _list;
     Elements& _elements;
+    size_t& _looks;
     NumberTable _equal;
     std::vector<uint32_t> _all; // ascending
     size_t _removals = 0, _others = 0;
@@ -276,6 +279,7 @@ public:
     }
 
     List list;
+    size_t looks = 0;
 
 private:
     Bucket& bucketOf(const UniqueId& identifier) {
@@ -291,6 +295,7 @@ private:
     bool passesWalk(Bucket& bucket, const CXDChangeRecord& record, uint32_t hash) {
         uint32_t* link = &bucket.last;
         while (*link != kNone) {
+            ++looks;
             Elements::Element& element = _elements[*link];
             const bool mayContradict = element.isRemoval != isRemoval(record);
             if (!mayContradict && element.hash == hash && list[element.record]->isEqual(record)) return false;
@@ -323,7 +328,7 @@ private:
     }
 
     void buildIndex(Bucket& bucket) {
-        bucket.index = std::make_unique<Index>(list, _elements);
+        bucket.index = std::make_unique<Index>(list, _elements, looks);
         std::vector<uint32_t> elements;
         for (uint32_t i = bucket.last; i != kNone; i = _elements[i].previous) elements.push_back(i);
         for (auto it = elements.rbegin(); it != elements.rend(); ++it) bucket.index->add(*it);
@@ -362,6 +367,10 @@ void Mingler::mingle(const CXDChangeRecords& records) {
         if (const UniqueId* person = personAt(i + kSlotAhead)) _buckets->prefetchSlotOf(*person);
         mingle(records[i]);
     }
+}
+
+size_t Mingler::elementsLookedAt() const {
+    return _buckets->looks;
 }
 
 CXDChangeRecords Mingler::takeMingled() {

@@ -29,6 +29,8 @@ public:
     // handled.
     void mingle(const CXDChangeRecords& records);
     CXDChangeRecords takeMingled();
+    // Its cost so far: how many elements of buckets were looked at.
+    size_t elementsLookedAt() const;
 
 private:
     class List;

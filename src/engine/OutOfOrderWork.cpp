@@ -7,6 +7,7 @@
 #include "foundation/Log.h"
 
 #include <algorithm>
+#include <charconv>
 #include <iterator>
 #include <system_error>
 #include <utility>
@@ -14,9 +15,22 @@
 namespace rolvane {
 
 namespace {
-constexpr double kIdleSeconds = 1.0;       // a worker that gets nothing for so long ends
+constexpr double kIdleSeconds = 1.0; // a worker that gets nothing for so long ends
+constexpr const char* kThreadCountKey = "CXDThreadCountKey";
+constexpr int64_t kDefaultWorkers = 3;
+constexpr int64_t kMostWorkers = 10;
 constexpr double kTerminationGlance = 0.2; // how often a wait without workers looks whether the process is to end
 } // namespace
+
+int64_t configuredWorkers(const NetworkAccount& account) {
+    const Value configured = account.configValueForKey(kThreadCountKey, kDefaultWorkers);
+    int64_t workers = configured.integer(kDefaultWorkers);
+    if (const std::string* text = configured.stringIf()) {
+        const auto [end, error] = std::from_chars(text->data(), text->data() + text->size(), workers);
+        if (error != std::errc() || end != text->data() + text->size()) workers = kDefaultWorkers;
+    }
+    return std::min(workers, kMostWorkers);
+}
 
 OutOfOrderWork::OutOfOrderWork(EngineParts& parts, CXDChangeRecords records)
     : _parts(parts), _turns(records), _outOfOrderLock(records.empty() ? 1 : 0),

@@ -13,6 +13,9 @@
 
 namespace rolvane {
 
+// How many workers a pass may have: a number, or a text that is one; 3 unless configured otherwise, 10 at most.
+int64_t configuredWorkers(const NetworkAccount& account);
+
 // The records of one pass that may be applied in any order, and the workers that apply them while the main thread
 // waits. A worker takes the record at the front, waits while another is at work on the same group or person, applies it
 // to the sources that it asks for, and reports it. A record with sources left over goes to the pending ones. Built,

@@ -96,6 +96,16 @@ struct CXDChangeRecord::Payload : SharedObject {
         if (value) return BinaryValue::encode(value);
         return encoded ? *encoded : Bytes();
     }
+    // As it stands in an archive: the object itself. Under the same key older archives have its BinaryValue bytes as a
+    // data value; so has this one what is data by itself, or cannot be decoded.
+    Value archived() const {
+        const Bytes all = bytes();
+        try {
+            if (Value object = BinaryValue::decode(all); object && !object.isData()) return object;
+        } catch (const CXException&) { // only a look inside finds the damage, when it is used
+        }
+        return Value(all);
+    }
     void pack() {
         const std::lock_guard guard(lock());
         if (!value) return;
@@ -216,9 +226,7 @@ void CXDChangeRecord::encodeWithCoder(Coder& coder) const {
     coder.encodeObject(valueOf(_puid), kPersonKey);
     coder.encodeObject(valueOf(_guid), kGroupKey);
     coder.encodeObject(valueOf(_user), kUserKey);
-    // The payload's BinaryValue bytes as a data value, so that a record on its way through the archive is never
-    // decoded.
-    if (_payload) coder.encodeObject(Value(_payload->bytes()), kPayloadKey);
+    if (_payload) coder.encodeObject(_payload->archived(), kPayloadKey);
 }
 
 CXDChangeRecord::CXDChangeRecord(const Coder& coder) {
@@ -233,8 +241,10 @@ CXDChangeRecord::CXDChangeRecord(const Coder& coder) {
     if (payload.isData()) {
         const auto held = std::make_shared<const Value>(payload);
         setEncodedPayload(std::shared_ptr<const Bytes>(held, &held->data())); // the very bytes of the value
-    } else
-        setPayload(payload);
+    } else if (payload) {
+        // A queue may hold very many: they stand in memory as bytes until somebody looks inside.
+        setEncodedPayload(std::make_shared<const Bytes>(BinaryValue::encode(payload)));
+    }
 }
 
 CXDChangeRecordPtr CXDChangeRecord::copy() const {

@@ -87,6 +87,24 @@ TEST_F(SubscribersRights, AreAskedOfTheAllContactsEntryByteForByte) {
                                     "</D:propfind>");
 }
 
+TEST_F(SubscribersRights, AreAskedAtTheSecureAddress) {
+    CXDAVAccount account;
+    account.user = UserName("alice");
+    account.endpoint = "http://plain.example.org/dav/{user}/Contacts";
+    account.secureEndpoint = "https://secure.example.org/dav/{user}/Contacts";
+    auto wire = std::make_shared<RecordingTransport>();
+    Names asked;
+    wire->intercept([&](const HttpRequest& request) {
+        asked.push_back(request.url.scheme() + " " + request.url.host());
+        return std::optional(AclStore::multistatus(AclStore::response(kEntry, privileges({"read", "write"}))));
+    });
+    CXDAVManager client(account, wire);
+    const Url bobs = account.baseLocationFor(UserName("bob"));
+    const CXDAVACLManager list(bobs, owner, client);
+    EXPECT_EQ(list.principalsWithAllAccess(), Users{kSelf});
+    EXPECT_EQ(asked, Names{"https secure.example.org"});
+}
+
 TEST_F(SubscribersRights, AreAskedAboutTheEntryItselfWhereAnUnboundedDepthIsRefused) {
     Names depths;
     store.instead = [&](const HttpRequest& r) -> std::optional<HttpResponse> {

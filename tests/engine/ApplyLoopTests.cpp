@@ -454,6 +454,15 @@ TEST_F(Pass, ADeniedChangeIsDroppedCancelsItsUsersOthersAndIsRetriedOnce) {
     EXPECT_EQ(world.events.count("CXDCX gather"), 1u) << "a retry schedules no other";
 }
 
+TEST_F(Pass, ADenialStandsUntilASourceSaysOtherwise) {
+    world.vaultra->whenApplying = [](const CXDChangeRecordPtr& record, bool* denied) {
+        if (record->user() == UserName("bob")) *denied = true;
+        return record->user() != UserName("bob");
+    };
+    trickle({update("B1", 5, "bob"), update("C1", 5, "carol"), update("C2", 5, "carol")});
+    EXPECT_EQ(world.vaultra->applied(), (Strings{"B1", "C1"})) << "the flag still stood when the third one's turn came";
+}
+
 TEST_F(Pass, AGroupOfWhichAChangeGotLostInAFoldIsComparedOnceMore) {
     const Dictionary writer{{"additions", Array{"bob"}}, {"deletions", Array()}};
     trickle({makeRecord(CXDChangeGroupReadWriteACL, nullptr, "G1", {}, writer),

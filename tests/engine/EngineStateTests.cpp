@@ -128,6 +128,25 @@ TEST(EngineMemory, AQueueThatCannotBeReadIsEmptyAndNothingIsLogged) {
     EXPECT_TRUE(log.lines().empty()) << log.text();
 }
 
+TEST(EngineMemory, AQueueWithADamagedRecordIsNotReturnedInPart) {
+    World world;
+    EngineState state(world.preferences);
+    state.setPendingChanges({update("P1"), update("P2")});
+    const Bytes sound = world.stored("CXDPendingChanges").data();
+    ASSERT_EQ(state.getPendingChanges().size(), 2u);
+
+    Bytes followed = sound;
+    followed.push_back(0);
+    Bytes cut(sound.begin(), sound.end() - 1);
+    const Bytes nameless = KeyedArchive::archive({{"CXDChangeRecord", {}}, {"", {}}});
+    Bytes keyless = nameless; // its last two bytes are the empty dictionary of keys
+    keyless[keyless.size() - 2] = 0x7f;
+    for (const Bytes& damaged : {followed, cut, keyless}) {
+        world.preferences.set(kDaemonDomain, "CXDPendingChanges", Value(damaged));
+        EXPECT_TRUE(state.getPendingChanges().empty()) << "the first one was sound";
+    }
+}
+
 TEST(EngineMemory, AResetForgetsEverythingButTheDebugLevel) {
     World world;
     world.start();

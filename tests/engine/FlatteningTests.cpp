@@ -12,39 +12,66 @@ namespace {
 
 using test::makeRecord;
 
-// Flattening as it reads.
-CXDChangeRecords literalFlat(const CXDChangeRecords& input) {
-    const auto named = [](const CXDChangeRecordPtr& r) { return r->group() && *r->group() != UniqueId("People"); };
-    CXDChangeRecords result, work;
-    for (const CXDChangeRecordPtr& record : input) {
-        if (named(record)) {
-            for (const CXDChangeRecordPtr& part : record->splitChangeRecord()) work.push_back(part);
-        } else {
-            work.push_back(record);
+// Flattening as it reads: a fold takes in every earlier change of the group, whoever's it is, and whatever it is.
+class LiteralFlattening {
+public:
+    virtual ~LiteralFlattening() = default;
+    CXDChangeRecords flat(const CXDChangeRecords& input) const {
+        CXDChangeRecords result, work;
+        for (const CXDChangeRecordPtr& record : input) {
+            if (isNamed(*record)) {
+                for (const CXDChangeRecordPtr& part : record->splitChangeRecord()) work.push_back(part);
+            } else {
+                work.push_back(record);
+            }
         }
+        while (!work.empty()) {
+            const CXDChangeRecordPtr x = work.back();
+            work.pop_back();
+            if (!startsFold(*x)) {
+                result.insert(result.begin(), x);
+                continue;
+            }
+            auto c = std::make_shared<CXDChangeRecord>(x->initialSource(), 3, x->user(), std::nullopt, x->group());
+            c->setAppliesToSources(x->appliesToSources());
+            c->mergeWithGroupChangeRecord(*x);
+            result.insert(result.begin(), c);
+            for (size_t i = work.size(); i-- > 0;) {
+                if (!takesIn(*x, *work[i])) continue;
+                c->mergeWithGroupChangeRecord(*work[i]);
+                work.erase(work.begin() + static_cast<std::ptrdiff_t>(i));
+            }
+        }
+        return result;
     }
-    while (!work.empty()) {
-        const CXDChangeRecordPtr x = work.back();
-        work.pop_back();
-        const int32_t t = x->type();
-        const bool folds = x->appliesToSources() != 1 && named(x) && t != 3 && t != 7 && t != 8 && t != 260 && t != 261;
-        if (!folds || !x->canBeMerged()) {
-            result.insert(result.begin(), x);
-            continue;
-        }
-        auto c = std::make_shared<CXDChangeRecord>(x->initialSource(), 3, x->user(), std::nullopt, x->group());
-        c->setAppliesToSources(x->appliesToSources());
-        c->mergeWithGroupChangeRecord(*x);
-        result.insert(result.begin(), c);
-        for (size_t i = work.size(); i-- > 0;) {
-            const bool same = work[i]->group() == x->group() && work[i]->user() == x->user();
-            if (!same || !work[i]->canBeMerged()) continue;
-            c->mergeWithGroupChangeRecord(*work[i]);
-            work.erase(work.begin() + static_cast<std::ptrdiff_t>(i));
-        }
+
+protected:
+    static bool isNamed(const CXDChangeRecord& r) { return r.group() && *r.group() != UniqueId("People"); }
+    virtual bool startsFold(CXDChangeRecord& x) const {
+        const int32_t t = x.type();
+        return x.appliesToSources() != 1 && isNamed(x) && t != 3 && t != 7 && t != 8 && t != 260 && t != 261;
     }
-    return result;
-}
+    virtual bool takesIn(const CXDChangeRecord& x, CXDChangeRecord& earlier) const {
+        return earlier.group() == x.group();
+    }
+};
+
+// The first departure: what merging refuses stands for itself. (By the letter it would end the pass.)
+class WhatMergingRefusesStands : public LiteralFlattening {
+protected:
+    bool startsFold(CXDChangeRecord& x) const override { return LiteralFlattening::startsFold(x) && x.canBeMerged(); }
+    bool takesIn(const CXDChangeRecord& x, CXDChangeRecord& earlier) const override {
+        return LiteralFlattening::takesIn(x, earlier) && earlier.canBeMerged();
+    }
+};
+
+// The second: a fold takes in changes of one user alone. (Every user has an all-contacts group, and all are called the
+// same: by the letter one user's members would be written to another one's tree.)
+class FoldsByUser : public WhatMergingRefusesStands {
+    bool takesIn(const CXDChangeRecord& x, CXDChangeRecord& earlier) const override {
+        return WhatMergingRefusesStands::takesIn(x, earlier) && earlier.user() == x.user();
+    }
+};
 
 std::string shown(const CXDChangeRecords& records) {
     std::string text;
@@ -55,9 +82,30 @@ std::string shown(const CXDChangeRecords& records) {
     return text;
 }
 
+CXDChangeRecords ofOneUser(const CXDChangeRecords& records) {
+    CXDChangeRecords all;
+    for (const CXDChangeRecordPtr& record : records) {
+        all.push_back(std::make_shared<CXDChangeRecord>(record->initialSource(), record->type(), UserName("ann"),
+                                                        record->person(), record->group(), record->payload()));
+        all.back()->setAppliesToSources(record->appliesToSources());
+    }
+    return all;
+}
+
 RC_GTEST_PROP(Flattening, GivesWhatTheLiteralLoopGives, ()) {
+    auto records = ofOneUser(*rc::gen::container<CXDChangeRecords>(test::arbitraryRecord()));
+    std::erase_if(records, [](const CXDChangeRecordPtr& record) { return !record->canBeMerged(); });
+    RC_ASSERT(shown(flattenGroupChanges(records)) == shown(LiteralFlattening().flat(records)));
+}
+
+RC_GTEST_PROP(Flattening, DepartsFromItWhereMergingRefuses, ()) {
+    const auto records = ofOneUser(*rc::gen::container<CXDChangeRecords>(test::arbitraryRecord()));
+    RC_ASSERT(shown(flattenGroupChanges(records)) == shown(WhatMergingRefusesStands().flat(records)));
+}
+
+RC_GTEST_PROP(Flattening, DepartsFromItWhereUsersMeetAndNowhereElse, ()) {
     const auto records = *rc::gen::container<CXDChangeRecords>(test::arbitraryRecord());
-    RC_ASSERT(shown(flattenGroupChanges(records)) == shown(literalFlat(records)));
+    RC_ASSERT(shown(flattenGroupChanges(records)) == shown(FoldsByUser().flat(records)));
 }
 
 TEST(Flattening, FoldsTheChangesOfOneGroupIntoACompositeAtTheLastOnesPlace) {

@@ -72,14 +72,18 @@ TEST_F(Workers, AreCountedByATextThatIsANumber) {
 }
 
 TEST_F(Workers, AreTenAtMost) {
+    for (const auto& [configured, expected] :
+         std::map<int64_t, int64_t>{{-1, -1}, {9, 9}, {10, 10}, {11, 10}, {50, 10}}) {
+        world.account.threads = configured;
+        EXPECT_EQ(configuredWorkers(world.account), expected);
+    }
     world.account.threads = 50;
-    Gate gate(10);
-    std::atomic<int> calls{0};
+    Gate gate(10); // all ten are there before any of them goes on, so that none of them can do another's work
     world.vaultra->whenApplying = [&](const CXDChangeRecordPtr&, bool*) {
-        if (++calls <= 10) gate.pass();
+        gate.pass();
         return true;
     };
-    world.engine->applyChangeRecords(updates(40));
+    world.engine->applyChangeRecords(updates(10));
     EXPECT_EQ(world.vaultra->threads(), 10u);
 }
 
@@ -205,6 +209,19 @@ TEST_F(Workers, ADenialCancelsTheUsersWaitingRecordsAndNobodyElses) {
     records.insert(records.begin(), ann);
     world.engine->applyChangeRecords(records, true, false);
     EXPECT_EQ(world.vaultra->applied(), (Strings{"A1", "P0"}));
+    EXPECT_TRUE(world.pending().empty());
+}
+
+// A source says that it refuses, and nobody takes that back but a source that is asked the next time.
+TEST_F(Workers, ADenialStandsUntilASourceSaysOtherwise) {
+    world.account.threads = 1;
+    world.vaultra->whenApplying = [](const CXDChangeRecordPtr& record, bool* denied) {
+        if (record->user() == UserName("bob")) *denied = true;
+        return record->user() != UserName("bob");
+    };
+    world.engine->applyChangeRecords({update("B1", 4, "bob"), update("C1", 4, "carol"), update("C2", 4, "carol")}, true,
+                                     false);
+    EXPECT_EQ(world.vaultra->applied(), (Strings{"B1", "C1"})) << "the flag still stood when the third one's turn came";
     EXPECT_TRUE(world.pending().empty());
 }
 

@@ -253,6 +253,22 @@ TEST(PublicationCache, SourcesOfAGroupAreTheStoresThatHoldIt) {
     EXPECT_EQ(sourcesForGUID(odd, group), 0) << "a damaged entry is nobody's";
 }
 
+TEST(PublicationCache, AGroupIsLookedForWithEveryUserOfASource) {
+    const UniqueId group("G2:CXGroup");
+    for (const char* holder : {"ann", "bob", "eve"}) {
+        Dictionary data;
+        for (const char* user : {"ann", "bob", "eve"}) {
+            Dictionary groups = data.dictionaryFor("CXDVaultra").dictionaryFor("priorState").dictionaryFor(user);
+            groups.dictionaryFor("G1:CXGroup");
+            if (std::string(user) == holder) groups.dictionaryFor(group.str());
+        }
+        EXPECT_EQ(sourcesForGUID(data, group), 4) << holder;
+    }
+    Dictionary both = publishedAt({"CXDVaultra"}, "ann");
+    both.dictionaryFor("CXDVaultra").dictionaryFor("priorState").dictionaryFor("bob").dictionaryFor("G1:CXGroup");
+    EXPECT_EQ(sourcesForGUID(both, UniqueId("G1:CXGroup")), 4) << "with two users, once";
+}
+
 TEST(PublicationCache, AGroupIsPublishedWhenTheOwnersStateHasIt) {
     EXPECT_TRUE(isGUIDPublished(publishedAt({"CXDCX"}, "<self>"), UniqueId("G1:CXGroup")));
     EXPECT_FALSE(isGUIDPublished(publishedAt({"CXDVaultra"}, "ann"), UniqueId("G1:CXGroup")));

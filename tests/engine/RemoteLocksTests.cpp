@@ -228,6 +228,16 @@ TEST_F(Locks, TheLockThatExpiresSoonestIsRenewedFirst) {
     store.waitFor("renew http://store.example/bob/Contacts/dateFile", 1);
 }
 
+TEST_F(Locks, OfTwoThatExpireTogetherTheFirstOneTakenIsRenewedFirst) {
+    lock("/G1");
+    locks.lockURL(Url("http://store.example/bob/Contacts/G1"));
+    locks.startRenewing();
+    sleep->waitForSleepOf(270);
+    sleep->letTimePass();
+    store.waitFor("renew " + clockFile, 1);
+    EXPECT_EQ(store.asked().at(2), "renew " + clockFile);
+}
+
 TEST_F(Locks, ALockThatCannotBeRenewedIsDroppedWithoutBeingReleased) {
     store.renews = false;
     locks.startRenewing();

@@ -54,6 +54,22 @@ std::shared_ptr<const Bytes> encoded(const Value& value) {
     return std::make_shared<const Bytes>(BinaryValue::encode(value));
 }
 
+constexpr std::string_view kOlderArchive =
+    "524b41310801076f626a656374730702080205636c617373040f4358444368616e67655265636f7264046b6579730806"
+    "134358444170706c696573546f536f757263657302080d4358444368616e676554797065020210435844496e69746961"
+    "6c536f7572636502020a4358445061796c6f6164061808020546697273740403416e6e0550686f6e6507010401310c43"
+    "5844506572736f6e554944040b50313a4358506572736f6e074358445573657204063c73656c663e080205636c617373"
+    "040f4358444368616e67655265636f7264046b6579730806134358444170706c696573546f536f757263657302080d43"
+    "58444368616e67655479706502080b43584447726f7570554944040a47313a435847726f757010435844496e69746961"
+    "6c536f7572636502020a4358445061796c6f616406090407467269656e6473074358445573657204063c73656c663e";
+
+Bytes bytesOf(std::string_view hexadecimal) {
+    Bytes bytes;
+    for (size_t i = 0; i + 1 < hexadecimal.size(); i += 2)
+        bytes.push_back(static_cast<uint8_t>(std::stoi(std::string(hexadecimal.substr(i, 2)), nullptr, 16)));
+    return bytes;
+}
+
 TEST(ChangeRecord, StartsWithBothMasksAtZeroAndKeepsWhatItWasGiven) {
     const CXDChangeRecord r(CXDSyncSourceVaultra, CXDAddRecordToGroup, UserName("ann"), kPerson, kGroup, "payload");
     EXPECT_EQ(r.initialSource(), CXDSyncSourceVaultra);
@@ -217,7 +233,36 @@ TEST(ChangeRecord, AnEncodedPayloadIsDecodedOnceAndStaysTheSameObject) {
     EXPECT_TRUE(first.dictionaryIf()->isSame(*r.payload().dictionaryIf()));
 }
 
-TEST(ChangeRecord, AnEncodedPayloadIsArchivedWithoutBeingDecoded) {
+TEST(ChangeRecord, AnArchivedPayloadIsThePayloadItself) {
+    const Dictionary contact{{"First", "Ann"}, {"Phone", Array{"1"}}};
+    for (const Value& payload : {Value(contact), Value("name"), Value(Array{1, 2})}) {
+        CXDChangeRecord given = record(1, 4, payload), read = record(1, 4);
+        read.setEncodedPayload(encoded(payload));
+        for (const CXDChangeRecord* r : {&given, &read}) {
+            MapCoder coder;
+            r->encodeWithCoder(coder);
+            EXPECT_EQ(coder.entries["CXDPayload"], payload);
+            EXPECT_EQ(CXDChangeRecord(coder).payload(), payload);
+        }
+    }
+}
+
+// An archive as version 0.1 wrote it: the payload's bytes under the key.
+TEST(ChangeRecord, AnOlderArchivesPayloadIsRead) {
+    const Bytes archive = bytesOf(kOlderArchive);
+    const auto objects = KeyedArchive::unarchive(archive);
+    ASSERT_EQ(objects.size(), 2U);
+    EXPECT_TRUE(objects[0].keys["CXDPayload"].isData());
+    CXDChangeRecord update{DictionaryCoder(objects[0].keys)};
+    EXPECT_EQ(update.type(), CXDUpdateRecord);
+    EXPECT_EQ(update.person(), UniqueId("P1:CXPerson"));
+    EXPECT_EQ(update.payload(), Value(Dictionary{{"First", "Ann"}, {"Phone", Array{"1"}}}));
+    CXDChangeRecord rename{DictionaryCoder(objects[1].keys)};
+    EXPECT_EQ(rename.type(), CXDChangeGroupName);
+    EXPECT_EQ(rename.payload(), Value("Friends"));
+}
+
+TEST(ChangeRecord, APayloadThatCannotBeDecodedStaysInTheArchiveAsItIs) {
     CXDChangeRecord r = record(1, 4);
     const Bytes undecodable{0xff, 0xfe};
     r.setEncodedPayload(std::make_shared<const Bytes>(undecodable));
