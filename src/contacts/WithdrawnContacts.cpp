@@ -21,6 +21,7 @@ namespace {
 
 constexpr const char* kUser = "User";
 constexpr const char* kLocation = "Location";
+constexpr const char* kSubscription = "Subscription";
 constexpr const char* kDate = "Date";
 constexpr const char* kPeople = "People";
 constexpr const char* kGroups = "Groups";
@@ -36,15 +37,14 @@ std::filesystem::path recordFile(const std::string& directory, const std::string
     throw CXException(kCXFileException, path + ": " + std::strerror(error));
 }
 
-// A name that no record of the folder has yet.
-std::string freshName(const std::string& directory, Date now, const UserName& user) {
-    constexpr size_t kLongestUser = 100;
-    std::string date = now.toISO8601();
-    std::replace(date.begin(), date.end(), ':', '-');
-    const std::string stem = date + "-" + Url::percentEncodeComponent(user.str()).substr(0, kLongestUser);
-    std::string name = stem;
-    for (int i = 2; std::filesystem::exists(recordFile(directory, name)); ++i) name = stem + "-" + std::to_string(i);
-    return name;
+std::optional<Dictionary> entryIn(const std::filesystem::path& file) {
+    try {
+        const Value value = PropertyList::fromXML(readFile(file));
+        if (value.dictionaryIf() && value.dictionary()[kDate].isDate()) return value.dictionary();
+    } catch (const CXException& e) {
+        CXDLog("A record of withdrawn contacts is left out: %@", e.reason());
+    }
+    return std::nullopt;
 }
 
 void syncFile(const std::string& path, int flags) {
@@ -82,10 +82,38 @@ void writeCards(CXRolvane& database, const std::vector<UniqueId>& records, const
 WithdrawnContactsFolder::WithdrawnContactsFolder(std::string directory)
     : _directory(directory.empty() ? dataDirectory() + "/withdrawn" : std::move(directory)) {}
 
+// That of the record of the same subscription; else one that neither a record nor cards have yet.
+std::string WithdrawnContactsFolder::nameFor(const UserName& user, const std::string& subscription, Date now) const {
+    constexpr size_t kLongestUser = 100;
+    std::error_code error;
+    for (std::filesystem::directory_iterator each(_directory, error), end; !error && each != end;
+         each.increment(error)) {
+        if (subscription.empty() || each->path().extension() != ".plist") continue;
+        const auto entry = entryIn(each->path());
+        if (entry && (*entry)[kSubscription].string() == subscription && (*entry)[kUser].string() == user.str())
+            return each->path().stem().string();
+    }
+    std::string date = now.toISO8601();
+    std::replace(date.begin(), date.end(), ':', '-');
+    const std::string stem = date + "-" + Url::percentEncodeComponent(user.str()).substr(0, kLongestUser);
+    const auto isTaken = [&](const std::string& name) {
+        return std::filesystem::exists(recordFile(_directory, name)) ||
+               std::filesystem::exists(cardsFile(_directory, name));
+    };
+    std::string name = stem;
+    for (int i = 2; isTaken(name); ++i) name = stem + "-" + std::to_string(i);
+    return name;
+}
+
 WithdrawnContacts WithdrawnContactsFolder::keep(CXRolvane& database, const RemoteLocation& location,
                                                 const UserName& user, Date now) {
     CXPathUtils_MakeCompletePath(_directory, 0700);
-    WithdrawnContacts record{user, location, now, 0, 0, {}, freshName(_directory, now, user)};
+    const CXSubscriptionRef subscribed = database.findSubscriptionWithRemoteLocation(location);
+    const std::string subscription = subscribed ? subscribed->uniqueId().str() : "";
+    WithdrawnContacts record{user, location, now, 0, 0, {}, nameFor(user, subscription, now)};
+    const std::string path = recordFile(_directory, record.name).string();
+    const auto before = std::filesystem::exists(path) ? entryIn(path) : std::nullopt;
+    if (before) record.date = (*before)[kDate].date().value_or(now);
     std::vector<UniqueId> uids;
     if (const CXAllGroupRef everybody = database.allGroupForRemoteLocation(location)) {
         uids = everybody->memberUniqueIds();
@@ -94,22 +122,23 @@ WithdrawnContacts WithdrawnContactsFolder::keep(CXRolvane& database, const Remot
         record.groups = groups.size();
         uids.insert(uids.end(), groups.begin(), groups.end());
     }
+    // The record comes first: by it a process that is killed while it writes the cards finds them again.
+    const Dictionary entry{{kUser, user},
+                           {kLocation, location},
+                           {kSubscription, subscription},
+                           {kDate, record.date},
+                           {kPeople, static_cast<int64_t>(record.people)},
+                           {kGroups, static_cast<int64_t>(record.groups)}};
+    writeFileDurably(path, PropertyList::toXML(entry));
+    if (uids.empty()) return record;
     const std::filesystem::path cards = cardsFile(_directory, record.name);
-    if (!uids.empty()) {
-        writeCards(database, uids, cards);
-        record.file = cards.string();
-    }
     try {
-        const Dictionary entry{{kUser, user},
-                               {kLocation, location},
-                               {kDate, now},
-                               {kPeople, static_cast<int64_t>(record.people)},
-                               {kGroups, static_cast<int64_t>(record.groups)}};
-        writeFileDurably(recordFile(_directory, record.name).string(), PropertyList::toXML(entry));
+        writeCards(database, uids, cards);
     } catch (...) {
-        ::unlink(cards.c_str());
+        if (!before) ::unlink(path.c_str());
         throw;
     }
+    record.file = cards.string();
     return record;
 }
 
@@ -119,23 +148,18 @@ std::vector<WithdrawnContacts> WithdrawnContactsFolder::list() const {
     for (std::filesystem::directory_iterator each(_directory, error), end; !error && each != end;
          each.increment(error)) {
         if (each->path().extension() != ".plist") continue;
-        try {
-            const Dictionary entry = PropertyList::fromXML(readFile(each->path())).dictionary();
-            const auto date = entry[kDate].date();
-            if (!date) continue;
-            WithdrawnContacts record{UserName(entry[kUser].string()),
-                                     RemoteLocation(entry[kLocation].string()),
-                                     *date,
-                                     static_cast<size_t>(std::max<int64_t>(0, entry[kPeople].integer())),
-                                     static_cast<size_t>(std::max<int64_t>(0, entry[kGroups].integer())),
-                                     {},
-                                     each->path().stem().string()};
-            const std::filesystem::path cards = cardsFile(_directory, record.name);
-            if (std::filesystem::exists(cards)) record.file = cards.string();
-            all.push_back(std::move(record));
-        } catch (const CXException& e) {
-            CXDLog("A record of withdrawn contacts is left out: %@", e.reason());
-        }
+        const auto entry = entryIn(each->path());
+        if (!entry) continue;
+        WithdrawnContacts record{UserName((*entry)[kUser].string()),
+                                 RemoteLocation((*entry)[kLocation].string()),
+                                 *(*entry)[kDate].date(),
+                                 static_cast<size_t>(std::max<int64_t>(0, (*entry)[kPeople].integer())),
+                                 static_cast<size_t>(std::max<int64_t>(0, (*entry)[kGroups].integer())),
+                                 {},
+                                 each->path().stem().string()};
+        const std::filesystem::path cards = cardsFile(_directory, record.name);
+        if (std::filesystem::exists(cards)) record.file = cards.string();
+        all.push_back(std::move(record));
     }
     std::sort(all.begin(), all.end(), [](const WithdrawnContacts& a, const WithdrawnContacts& b) {
         return a.date != b.date ? a.date > b.date : a.name > b.name;

@@ -11,6 +11,7 @@
 #include "daemon/CheckIn.h"
 #include "daemon/DesktopAlert.h"
 #include "daemon/InstanceLock.h"
+#include "daemon/Leftovers.h"
 #include "daemon/OwnPasses.h"
 #include "daemon/TerminationWatch.h"
 #include "engine/CXDSyncEngine.h"
@@ -273,6 +274,7 @@ int runDaemon(int argc, char** argv) {
             return 0;
         }
         daemon.listen(controlPath); // the lock's holder alone does
+        removeLeftovers();
         CXDLog("Checking in with kickerd.");
         const CheckInPorts ports = CXDCheckIn(RunLoop::current());
 

@@ -6,6 +6,7 @@
 #include <cerrno>
 #include <chrono>
 #include <csignal>
+#include <cstddef>
 #include <cstdlib>
 #include <cstring>
 #include <fcntl.h>
@@ -80,33 +81,45 @@ int runQuietly(std::vector<std::string> arguments) {
     return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
 
-// Where the daemon says that it is ready; the file goes with the object.
+// Where the daemon says that it is ready: a socket without a file, which is gone with this process however it ends.
+// Only what a process of this user says counts.
 class NotifySocket {
 public:
-    NotifySocket() : _path(fmt::format("{}/notify-{}", runtimeDirectory(), makeUUID())), _fd(open(_path)) {}
-    ~NotifySocket() { ::unlink(_path.c_str()); }
-    const std::string& path() const { return _path; }
+    NotifySocket() : _name("rolvane-notify-" + makeUUID()), _fd(open(_name)) {}
+    std::string path() const { return "@" + _name; } // as sd_notify wants it
     int get() const { return _fd.get(); }
     bool ready() const {
         char text[512];
-        const ssize_t n = ::recv(_fd.get(), text, sizeof text, MSG_DONTWAIT);
-        return n > 0 && std::string_view(text, static_cast<size_t>(n)).find("READY=1") != std::string_view::npos;
+        alignas(cmsghdr) char control[CMSG_SPACE(sizeof(ucred))];
+        iovec bytes{text, sizeof text};
+        msghdr message{};
+        message.msg_iov = &bytes;
+        message.msg_iovlen = 1;
+        message.msg_control = control;
+        message.msg_controllen = sizeof control;
+        const ssize_t n = ::recvmsg(_fd.get(), &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
+        const cmsghdr* header = n > 0 ? CMSG_FIRSTHDR(&message) : nullptr;
+        if (!header || header->cmsg_level != SOL_SOCKET || header->cmsg_type != SCM_CREDENTIALS) return false;
+        ucred sender{};
+        std::memcpy(&sender, CMSG_DATA(header), sizeof sender);
+        return sender.uid == ::geteuid() &&
+               std::string_view(text, static_cast<size_t>(n)).find("READY=1") != std::string_view::npos;
     }
 
 private:
-    static Descriptor open(const std::string& path) {
+    static Descriptor open(const std::string& name) {
         sockaddr_un address{};
         address.sun_family = AF_UNIX;
-        if (path.size() >= sizeof address.sun_path)
-            fail(
-                fmt::format("The path {} is too long for a socket. Set XDG_RUNTIME_DIR to a shorter directory.", path));
-        std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
+        std::memcpy(address.sun_path + 1, name.data(), name.size()); // the first byte is zero: no file
+        const auto size = static_cast<socklen_t>(offsetof(sockaddr_un, sun_path) + 1 + name.size());
         Descriptor fd(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
-        if (fd.get() < 0 || ::bind(fd.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0)
-            fail(fmt::format("The socket {} cannot be made ({}).", path, std::strerror(errno)));
+        const int on = 1;
+        if (fd.get() < 0 || ::setsockopt(fd.get(), SOL_SOCKET, SO_PASSCRED, &on, sizeof on) != 0 ||
+            ::bind(fd.get(), reinterpret_cast<const sockaddr*>(&address), size) != 0)
+            fail(fmt::format("A socket for the daemon's answer cannot be made ({}).", std::strerror(errno)));
         return fd;
     }
-    std::string _path;
+    std::string _name;
     Descriptor _fd;
 };
 

@@ -1,6 +1,7 @@
 #include "foundation/Paths.h"
 
 #include "foundation/SystemError.h"
+#include "foundation/TemporaryFiles.h"
 
 #include <algorithm>
 #include <array>
@@ -10,6 +11,7 @@
 #include <fcntl.h>
 #include <fmt/format.h>
 #include <pwd.h>
+#include <sys/file.h>
 #include <sys/random.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -37,12 +39,15 @@ private:
     int _fd;
 };
 
-// Unlinks the file at the end unless it was kept.
+// Unlinks the file at the end unless it was kept. It is locked until then, so that nobody takes it for one that a
+// killed process has left.
 class TemporaryFile {
 public:
     explicit TemporaryFile(const std::string& beside)
-        : _path(beside + ".XXXXXX"), _fd(::mkostemp(_path.data(), O_CLOEXEC)) {
+        : _path(beside + kTemporaryMark + "XXXXXX"), _fd(::mkostemp(_path.data(), O_CLOEXEC)),
+          _lock(_fd ? ::fcntl(_fd.get(), F_DUPFD_CLOEXEC, 0) : -1) {
         if (!_fd) throw cxSystemException("make a temporary file beside", beside, errno);
+        if (_lock) ::flock(_lock.get(), LOCK_EX | LOCK_NB);
     }
     TemporaryFile(const TemporaryFile&) = delete;
     TemporaryFile& operator=(const TemporaryFile&) = delete;
@@ -57,7 +62,7 @@ public:
 
 private:
     std::string _path;
-    Descriptor _fd;
+    Descriptor _fd, _lock; // one file; the lock lasts until both are closed
     bool _kept = false;
 };
 

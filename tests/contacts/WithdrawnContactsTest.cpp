@@ -99,8 +99,36 @@ TEST_F(Withdrawn, WhatWasKeptIsListedLatestFirstByAnyProcess) {
 }
 
 TEST_F(Withdrawn, TwoOfOneSecondAreTwo) {
-    EXPECT_NE(keep().file, keep().file);
+    const std::string first = keep().file;
+    database.removeRecord(database.findSubscriptionWithRemoteLocation(kBobs));
+    database.addRecord(CXSubscription::create(kBobs)); // subscribed to again
+    database.save();
+    EXPECT_NE(keep().file, first);
     EXPECT_EQ(folder.list().size(), 2u);
+}
+
+TEST_F(Withdrawn, AProcessThatIsKilledBeforeTheCopiesLeaveMakesNoSecondRecord) {
+    const WithdrawnContacts first = keep(); // killed here
+    const WithdrawnContacts second =
+        WithdrawnContactsFolder(folder.directory()).keep(database, kBobs, UserName("bob"), kNow.addingSeconds(600));
+    EXPECT_EQ(second.file, first.file);
+    EXPECT_EQ(second.date, kNow) << "that is when it ended";
+    ASSERT_EQ(folder.list().size(), 1u);
+    EXPECT_EQ(folder.list()[0].people, 2u);
+}
+
+TEST_F(Withdrawn, OneThatIsKilledAmidTheCardsLeavesNothingButWhatTheNextOneCompletes) {
+    const WithdrawnContacts kept = keep();
+    // What it has done by then: the record is there, the cards are not whole.
+    std::filesystem::rename(kept.file, kept.file + ".making");
+    std::filesystem::resize_file(kept.file + ".making", 10);
+    const WithdrawnContacts again = folder.keep(database, kBobs, UserName("bob"), kNow.addingSeconds(600));
+    EXPECT_EQ(again.file, kept.file);
+    size_t files = 0;
+    for (const auto& each : std::filesystem::directory_iterator(folder.directory())) files += each.is_regular_file();
+    EXPECT_EQ(files, 2u);
+    CXRolvane other({.path = directory / "other.db", .program = "test"});
+    EXPECT_EQ(VCardImport::importFile(other, kept.file).imported, 2u);
 }
 
 TEST_F(Withdrawn, WithoutCopiesThereIsARecordAndNoFile) {
