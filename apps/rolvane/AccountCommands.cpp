@@ -1,4 +1,5 @@
 #include "Context.h"
+#include "FailureText.h"
 #include "Terminal.h"
 
 #include "daemon/DaemonControl.h"
@@ -63,10 +64,14 @@ std::optional<CXDAVAccount> savedAccount() {
     return CXDAVAccount::load();
 }
 
-// The last pass has ended for that, and the daemon with it.
+// The last pass has ended for that, and the daemon with it: nothing else would start it.
 bool passwordWasRefused() {
-    const auto outcome = lastOutcome(Preferences::shared());
-    return outcome && resultOf(*outcome).passwordRefused;
+    try {
+        const auto outcome = lastOutcome(Preferences::shared());
+        return outcome && resultOf(*outcome).passwordRefused;
+    } catch (const CXException&) {
+        return false; // damaged preferences are told by whoever needs them
+    }
 }
 
 void setAccount(Context& context, CLI::App& command, const AccountOptions& options) {
@@ -98,8 +103,8 @@ void setAccount(Context& context, CLI::App& command, const AccountOptions& optio
         daemon.restart(); // it reads the account once
         context.say("RolvaneManager was started anew with it.");
     } else if (passwordWasRefused()) {
-        daemon.start(); // the refusal has ended it
-        context.say("RolvaneManager is at work again.");
+        daemon.start();
+        context.say("RolvaneManager, which had ended because the password was refused, runs again and goes on.");
     }
     if (!formerUser.empty() && formerUser != account.user.str())
         context.say("The account's user is another one than before: the next pass starts from nothing and compares "
@@ -148,21 +153,17 @@ void testAccount(Context& context) {
     const auto account = savedAccount();
     if (!account) throw CommandError(kNotFound, "There is no account on a store yet. `rolvane account set` makes one.");
     requirePassword(*account);
-    CXDAVError error;
-    const bool reachable = CXDAVManager::canReachOstrelError(error);
-    const bool structure = reachable && CXDAVManager::defaultManager().sanityCheckPublishStructureCreate(false);
+    const auto failure = testStore();
+    const bool structure = !failure && CXDAVManager::defaultManager().sanityCheckPublishStructureCreate(false);
+    const FailureScene scene = sceneOfTheAccount(Clock::system().now());
+    const FailureText text = failure ? failureText(*failure, scene) : FailureText{kOk, {}, {}};
     if (context.json)
-        context.print({{"reachable", reachable},
-                       {"code", error.code},
-                       {"reason", reachable ? Json() : Json(error.reason)},
+        context.print({{"reachable", !failure},
+                       {"code", failure ? failure->error : 0},
+                       {"reason", failure ? Json(text.what) : Json()},
+                       {"failure", failure ? failureJson(*failure, scene) : Json()},
                        {"published", structure}});
-    if (!reachable) {
-        const bool refused = error.code == kCXDAVErrorAuthentication;
-        throw CommandError(refused ? kRefused : kUnreachable,
-                           error.reason.empty() ? "The store's address cannot be reached from this machine now. Is the "
-                                                  "network up?"
-                                                : error.reason);
-    }
+    if (failure) throw CommandError(text.code, text.what + " " + text.toDo);
     context.say(structure ? "The store can be used, and the account's tree is there."
                           : "The store can be used; the account has no tree there yet.");
 }

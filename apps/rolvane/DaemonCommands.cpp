@@ -1,6 +1,8 @@
 #include "Context.h"
 #include "Counted.h"
+#include "FailureText.h"
 #include "LeftOnStore.h"
+#include "PassReport.h"
 #include "PassWatch.h"
 #include "Publication.h"
 #include "Subscriptions.h"
@@ -8,13 +10,16 @@
 
 #include "daemon/DaemonControl.h"
 #include "engine/EngineState.h"
+#include "engine/PassOutcome.h"
 #include "store/CXDAVManager.h"
 
 #include <csignal>
 #include <fmt/format.h>
 #include <iostream>
+#include <set>
 #include <sys/signalfd.h>
 #include <unistd.h>
+#include <utility>
 
 namespace rolvane::cli {
 
@@ -50,13 +55,33 @@ Json dateOrNull(const Value& value) {
 Json storeStatus() {
     const CXDAVAccount& account = CXDAVManager::defaultManager().account();
     if (account.user.empty()) return Json();
-    CXDAVError error;
-    const bool reachable = CXDAVManager::canReachOstrelError(error);
+    const auto failure = testStore();
+    const FailureScene scene = sceneOfTheAccount(Clock::system().now());
+    const Json told = failure ? failureJson(*failure, scene) : Json();
     return {{"user", account.user.str()},
             {"endpoint", account.endpoint},
             {"location", CXDAVManager::ostrelBaseLocationForOstrelUser(account.user).absoluteString()},
-            {"reachable", reachable},
-            {"reason", reachable ? Json() : Json(error.reason)}};
+            {"reachable", !failure},
+            {"reason", failure ? told["what"] : Json()},
+            {"toDo", failure ? told["toDo"] : Json()}};
+}
+
+// Records that were changed since the daemon looked at the database last. More than so many are not counted.
+size_t editsNotLookedAt(CXRolvane& database) {
+    constexpr size_t kMost = 1000;
+    const int64_t cursor = database.cursorPosition("RolvaneManager");
+    if (cursor < 0) return 0; // it scans the whole database when it comes
+    std::set<UniqueId> records;
+    for (const CXJournalEntry& entry : database.journalEntries(cursor, kMost))
+        if (entry.program != "RolvaneManager") records.insert(entry.uniqueId);
+    return records.size();
+}
+
+int64_t waitingIn(const std::optional<PassOutcome>& outcome) {
+    int64_t waiting = 0;
+    if (outcome)
+        for (const PassTree& tree : outcome->trees) waiting += tree.out.waiting + tree.in.waiting;
+    return waiting;
 }
 
 Json refusedJson(const Preferences& preferences) {
@@ -118,6 +143,8 @@ Json status(Context& context) {
                                  {"location", s->remoteLocation().str()},
                                  {"writable", s->isWritable()}});
     const auto pid = DaemonControl().running();
+    const auto outcome = lastOutcome(preferences);
+    const bool shares = publication.anything() || !subscriptions.empty();
     return {{"people", database.countPeople(RemoteLocation(""))},
             {"groups", database.listGroups(RemoteLocation("")).size()},
             {"daemon", pid ? Json(*pid) : Json()},
@@ -127,9 +154,10 @@ Json status(Context& context) {
             {"subscriptions", subscriptions},
             {"withdrawn", withdrawnJson()},
             {"refused", refusedJson(preferences)},
-            {"pending", EngineState(preferences).getPendingChanges().size()},
-            {"lastPass", dateOrNull(preferences.get(kDaemonDomain, kCXDCXConduitLastSyncDate))},
-            {"lastStorePass", dateOrNull(preferences.get(kDaemonDomain, kCXDVaultraConduitLastSyncDate))}};
+            {"pending", waitingIn(outcome)},
+            {"notLookedAt", shares ? editsNotLookedAt(database) : 0},
+            {"lastPass", outcome ? Json(outcome->ended.toISO8601()) : Json()},
+            {"pass", outcomeJson(outcome)}};
 }
 
 std::string publishedText(const Json& published) {
@@ -149,6 +177,19 @@ std::string subscribedText(const Json& subscriptions) {
     return text.empty() ? "to nobody" : text;
 }
 
+// When the tree was last as it should be, and since when it is not.
+std::string inStepText(const Json& tree) {
+    const bool own = tree["own"];
+    const Json& direction = tree[own ? "out" : "in"];
+    const auto date = [&](const char* key) {
+        return direction[key].is_null() ? "" : direction[key].get<std::string>();
+    };
+    const std::string last = date("inStep"), since = date("waitingSince");
+    return fmt::format("{}: {}{}{}", own ? "your own contacts" : tree["user"].get<std::string>() + "'s contacts",
+                       own ? "sent " : "read ", last.empty() ? "never" : last,
+                       since.empty() ? "" : ", what came after that waits since " + since);
+}
+
 void showStatus(Context& context) {
     const Json s = status(context);
     if (context.json) return context.print(s);
@@ -164,8 +205,8 @@ void showStatus(Context& context) {
     } else {
         const Json& store = s["store"];
         row("Store", fmt::format("{} at {}", store["user"].get<std::string>(), store["endpoint"].get<std::string>()));
-        row("", store["reachable"].get<bool>() ? "can be reached"
-                                               : "cannot be used: " + store["reason"].get<std::string>());
+        row("", store["reachable"].get<bool>() ? "can be reached" : store["reason"].get<std::string>());
+        if (!store["reachable"].get<bool>()) row("", store["toDo"].get<std::string>());
     }
     row("Published", publishedText(s["published"]));
     if (s["leftOnStore"])
@@ -174,7 +215,14 @@ void showStatus(Context& context) {
     for (const Json& record : s["withdrawn"]) row("Withdrawn", withdrawnText(record));
     for (const Json& record : s["refused"]) row("Refused", refusedText(record));
     row("Waiting", counted(pending, "change", "changes"));
-    row("Last pass", s["lastPass"].is_null() ? "never" : s["lastPass"].get<std::string>());
+    if (const size_t edited = s["notLookedAt"]; edited > 0)
+        row("", fmt::format("{} edited since the daemon looked last{}", counted(edited, "record was", "records were"),
+                            s["daemon"].is_null() ? "; it is not running" : ""));
+    if (s["pass"].is_null()) return row("Last pass", "never");
+    std::string label = "In step";
+    for (const Json& tree : s["pass"]["trees"]) row(std::exchange(label, ""), inStepText(tree));
+    row("Last pass", s["lastPass"].get<std::string>());
+    for (const Json& message : s["pass"]["messages"]) row("", message.get<std::string>());
 }
 
 // The terminal's end of a watch: interrupt and termination end it in order.
@@ -205,6 +253,13 @@ struct WatchOptions {
     bool once = false;
     double seconds = 0; // 0: until it is interrupted
 };
+
+void tellEnd(Context& context, const PassOutcome& outcome) {
+    if (context.json) return context.line(Json{{"event", "ended"}, {"pass", outcomeJson(outcome)}}.dump());
+    const PassReport told = reportOf(outcome, !outcome.full);
+    for (const std::string& line : told.lines) context.line(line);
+    if (told.lines.empty()) context.line(outcome.full ? "Everything is up to date." : "Everything is on the store.");
+}
 
 void watch(Context& context, const WatchOptions& options) {
     PassWatch pass(context);
@@ -238,14 +293,27 @@ void watch(Context& context, const WatchOptions& options) {
         std::fflush(stdout);
         std::cout.flush();
     };
+    std::optional<PassOutcome> outcome;
+    const ObservationHandle ended = context.bus().observe(
+        kCXDPassEndedNotification,
+        [&](const Notification& notification) {
+            const auto heard = decodeOutcome(notification.userInfo);
+            if (!heard) return;
+            outcome = heard;
+            bar.reset();
+            tellEnd(context, *outcome);
+            std::cout.flush();
+        },
+        false);
     if (context.json) {
         context.line(Json{{"event", "watching"}}.dump()); // from here on nothing is missed
         std::cout.flush();
     }
     constexpr double kForever = 1e9;
-    const bool ended = pass.waitUntil([&] { return interrupt.came() || (options.once && pass.stopped() > 0); },
-                                      options.seconds > 0 ? options.seconds : kForever);
-    if (!ended && options.once)
+    const bool inTime = pass.waitUntil([&] { return interrupt.came() || (options.once && outcome); },
+                                       options.seconds > 0 ? options.seconds : kForever);
+    if (options.once && outcome) context.exitCode = reportOf(*outcome, !outcome->full).code;
+    if (!inTime && options.once)
         throw CommandError(kUnreachable, fmt::format("No pass ended within {} seconds.{}", options.seconds,
                                                      runs ? ""
                                                           : " RolvaneManager is not running; `rolvane daemon "
@@ -271,7 +339,7 @@ void addDaemonCommands(CLI::App& app, Context& context) {
     addCommand(
         app, context, "watch", "Show the daemon's progress as it comes",
         [&](CLI::App& command) {
-            command.add_flag("--once", options->once, "End with the first pass that ends");
+            command.add_flag("--once", options->once, "End with the first pass that ends, and with its exit code");
             command.add_option("--seconds", options->seconds, "End after so many seconds")->check(CLI::PositiveNumber);
         },
         [&context, options] { watch(context, *options); });

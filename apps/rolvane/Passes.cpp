@@ -1,12 +1,12 @@
 #include "Passes.h"
 
-#include "Counted.h"
+#include "PassReport.h"
 #include "Publication.h"
 
 #include "daemon/DaemonControl.h"
-#include "engine/EngineState.h"
 #include "store/CXDAVManager.h"
 
+#include <algorithm>
 #include <chrono>
 #include <fmt/format.h>
 
@@ -17,12 +17,21 @@ namespace {
 constexpr const char* kDaemonProgram = "RolvaneManager";
 constexpr const char* kMakePass = "SimulateVaultraNotification";
 
-// A daemon that ends in the middle would be waited for in vain.
-void requireDaemon(const DaemonControl& daemon) {
-    if (daemon.running()) return;
+[[noreturn]] void endedWithoutAWord() {
     throw CommandError(kFailed, fmt::format("RolvaneManager ended before the pass was done. What is left is kept; "
                                             "`rolvane sync` goes on with it. Its log is {}.",
                                             DaemonControl::logPath()));
+}
+
+// The outcome of a pass of its own, or of one that a daemon made just before it ended.
+PassOutcome outcomeOfOnce(PassWatch& watch, OutcomeWatch& outcomes, double seconds) {
+    constexpr double kLastWords = 2; // a broadcast may still be on its way
+    const DaemonControl daemon;
+    if (!outcomes.latest()) daemon.runOnce(seconds);
+    watch.waitUntil([&] { return outcomes.latest().has_value(); }, kLastWords);
+    const auto outcome = outcomes.latest();
+    if (!outcome) endedWithoutAWord();
+    return *outcome;
 }
 
 } // namespace
@@ -40,23 +49,8 @@ Url ownBase() {
     return CXDAVManager::ostrelBaseLocationForOstrelUser(UserName(user));
 }
 
-int64_t pendingChanges() {
-    return static_cast<int64_t>(EngineState(Preferences::shared()).getPendingChanges().size());
-}
-
-void reportPending(Context& context) {
-    const int64_t waiting = pendingChanges();
-    if (waiting == 0) return;
-    CXDAVError error;
-    const bool reachable = CXDAVManager::canReachOstrelError(error);
-    context.warn(fmt::format("{}: {}", counted(waiting, "change waits", "changes wait"),
-                             reachable ? "the store did not take them yet. They are tried again in the next pass."
-                                       : error.reason + " They are sent when the store can be reached again."));
-    context.exitCode = reachable ? kFailed : error.code == kCXDAVErrorAuthentication ? kRefused : kUnreachable;
-}
-
-void waitForPass(Context& context, PassWatch& watch, const std::string& label, int64_t position, Date saved,
-                 double seconds) {
+PassOutcome waitForPass(Context& context, PassWatch& watch, OutcomeWatch& outcomes, const std::string& label,
+                        int64_t position, double seconds) {
     ProgressBar bar(context, label);
     watch.onEvent = [&](const PassWatch::Event& event) {
         if (event.kind == PassWatch::Event::Kind::progress) bar.update(event.fraction);
@@ -65,14 +59,19 @@ void waitForPass(Context& context, PassWatch& watch, const std::string& label, i
     const DaemonControl daemon;
     const auto start = std::chrono::steady_clock::now();
     bool asked = false;
+    std::optional<PassOutcome> outcome;
     const auto passed = [&] {
-        const auto lastPass = Preferences::shared().get(kDaemonDomain, kCXDCXConduitLastSyncDate).date();
-        return lastPass && *lastPass > saved && database.cursorPosition(kDaemonProgram) >= position;
+        outcome = outcomes.settled();
+        // A pass that failed leaves the journal where it was.
+        return outcome && (!isComplete(*outcome) || database.cursorPosition(kDaemonProgram) >= position);
     };
     const auto done = watch.waitUntil(
         [&] {
             if (passed()) return true;
-            requireDaemon(daemon);
+            if (!daemon.running()) {
+                if ((outcome = outcomes.latest())) return true; // it ended with its pass
+                endedWithoutAWord();
+            }
             // The daemon made no pass of the change, as of one that leads to nothing, or did not hear of it.
             constexpr std::chrono::seconds kSilence(2);
             if (!asked && !watch.atWork() && std::chrono::steady_clock::now() - start > kSilence)
@@ -85,40 +84,48 @@ void waitForPass(Context& context, PassWatch& watch, const std::string& label, i
         throw CommandError(kUnreachable, fmt::format("The daemon had not finished after {} seconds; it goes on by "
                                                      "itself. `rolvane watch` shows how far it is.",
                                                      seconds));
+    return *outcome;
 }
 
-void makePass(Context& context, double seconds) {
+PassOutcome makePass(Context& context, double seconds) {
     const DaemonControl daemon;
-    if (!daemon.running()) {
-        daemon.runOnce(seconds);
-        return;
-    }
     PassWatch watch(context, !context.quiet);
+    OutcomeWatch outcomes(context);
+    if (!daemon.running()) return outcomeOfOnce(watch, outcomes, seconds);
     ProgressBar bar(context, "Synchronising");
-    int stoppedBefore = -1;
-    bool asked = false; // what was heard before belongs to another pass
     watch.onEvent = [&](const PassWatch::Event& event) {
         if (event.kind == PassWatch::Event::Kind::progress) bar.update(event.fraction);
-        if (asked && event.kind == PassWatch::Event::Kind::started && stoppedBefore < 0)
-            stoppedBefore = watch.stopped();
     };
-    asked = true;
     const auto served = watch.tell(kMakePass);
     if (served && !*served) { // there was nothing to serve when it started
         daemon.stop();
-        daemon.runOnce(seconds);
+        const PassOutcome outcome = outcomeOfOnce(watch, outcomes, seconds);
         daemon.start();
-        return;
+        return outcome;
     }
-    const auto passed = [&] { return stoppedBefore >= 0 && watch.stopped() > stoppedBefore; };
-    const bool inVain = !watch.waitUntil([&] { return passed() || !daemon.running(); }, seconds);
+    std::optional<PassOutcome> outcome;
+    const auto passed = [&] {
+        outcome = outcomes.settled();
+        return outcome && outcome->full;
+    };
+    const bool inTime = watch.waitUntil([&] { return passed() || !daemon.running(); }, seconds);
     watch.onEvent = nullptr;
-    // It was just ending, because nothing is shared any more for instance.
-    if (!inVain && !passed()) return daemon.runOnce(seconds);
-    if (inVain)
+    if (!inTime)
         throw CommandError(kUnreachable, fmt::format("No pass ended within {} seconds. `rolvane daemon status` tells "
                                                      "whether the daemon is at work.",
                                                      seconds));
+    if (passed()) return *outcome;
+    return outcomeOfOnce(watch, outcomes, seconds); // it was just ending
+}
+
+bool mayGoBetter(const PassOutcome& outcome) {
+    constexpr int kConflict = 412, kLocked = 423;
+    if (!outcome.storeReached || !isComplete(outcome)) return false;
+    return std::any_of(outcome.trees.begin(), outcome.trees.end(), [](const PassTree& tree) {
+        if (tree.out.waiting == 0) return false;
+        const int status = tree.out.why ? tree.out.why->status : 0;
+        return status == 0 || status == kConflict || status == kLocked;
+    });
 }
 
 void sync(Context& context, double seconds) {
@@ -129,12 +136,11 @@ void sync(Context& context, double seconds) {
         context.say("Nothing is published and nobody is subscribed to: there is nothing to bring up to date.");
         return;
     }
-    makePass(context, seconds);
-    // A record that met a lock of its tree waits for the next pass, and so may a connection that a restart has cut.
-    CXDAVError error;
-    if (pendingChanges() > 0 && CXDAVManager::canReachOstrelError(error)) makePass(context, seconds);
-    reportPending(context);
-    if (context.exitCode == kOk) context.say("Everything is up to date.");
+    (void)ownBase(); // an account that cannot be used is told in its own words
+    PassOutcome outcome = makePass(context, seconds);
+    if (mayGoBetter(outcome)) outcome = makePass(context, seconds);
+    report(context, outcome, "Everything is up to date.");
+    if (context.json) context.print(outcomeJson(outcome));
 }
 
 } // namespace rolvane::cli

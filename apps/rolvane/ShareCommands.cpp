@@ -1,4 +1,6 @@
 #include "Context.h"
+#include "FailureText.h"
+#include "PassReport.h"
 #include "Passes.h"
 #include "Publication.h"
 #include "Shares.h"
@@ -62,10 +64,7 @@ Json orNull(const std::optional<Date>& date) {
 
 // Refuses where the store cannot do what is asked.
 void requireAccessLists(const Url& base, const std::string& user) {
-    CXDAVError error;
-    if (!CXDAVManager::canReachOstrelError(error))
-        throw CommandError(error.code == kCXDAVErrorAuthentication ? kRefused : kUnreachable,
-                           error.reason + " Nothing was changed.");
+    requireStore("Nothing was changed.");
     const auto keeps = CXDAVManager::defaultManager().keepsAccessLists();
     if (!keeps)
         throw CommandError(kUnreachable, "The store does not say whether it keeps access lists. Nothing was changed; "
@@ -120,26 +119,25 @@ void takeInWhatWasWritten(Context& context, double seconds) {
 void carry(Context& context, PassWatch& watch, const ShareOptions& options, const Url& base) {
     CXRolvane& database = context.database();
     const int64_t position = database.journalPosition();
-    const Date saved = Clock::system().now();
+    OutcomeWatch outcomes(context);
     const DaemonControl daemon;
     if (!daemon.start() && !watch.tell(kAllACLChanged).value_or(false)) daemon.restart();
     if (options.noWait) return;
-    waitForPass(context, watch, "Sharing", position, saved, options.timeout);
+    PassOutcome outcome = waitForPass(context, watch, outcomes, "Sharing", position, options.timeout);
     const Shares shares(database);
     const auto agrees = [&] {
         const auto lists = storeLists(base);
         return lists && same(lists->rightsOf(options.user), rightsHere(shares, options.user));
     };
     if (agrees()) return context.say("The store has it.");
-    CXDAVError error;
-    if (CXDAVManager::canReachOstrelError(error)) makePass(context, options.timeout);
+    if (outcome.storeReached && isComplete(outcome)) outcome = makePass(context, options.timeout);
     if (agrees()) return context.say("The store has it.");
-    const bool reachable = CXDAVManager::canReachOstrelError(error);
-    throw CommandError(reachable ? kFailed : kUnreachable,
-                       reachable ? fmt::format("The store did not take it. Perhaps it knows no user \"{0}\": check the "
-                                               "name, and take it back with `rolvane unshare {0}`.",
-                                               options.user)
-                                 : error.reason + " The store learns of it when it can be reached again.");
+    const PassTree* own = outcome.tree(kSelf);
+    const bool toldWhy = !outcome.storeReached || !isComplete(outcome) || !own || own->ended || own->out.why;
+    if (toldWhy && !report(context, outcome, {}, true)) return;
+    throw CommandError(kFailed, fmt::format("The store did not take it. Perhaps it knows no user \"{0}\": check the "
+                                            "name, and take it back with `rolvane unshare {0}`.",
+                                            options.user));
 }
 
 void changeShares(Context& context, const ShareOptions& options, bool grant) {
@@ -244,9 +242,7 @@ void showRights(Context& context, const std::string& named) {
     (void)ownBase();
     const RemoteLocation location = namedLocation(named);
     const std::string user = publisherOf(location);
-    CXDAVError error;
-    if (!CXDAVManager::canReachOstrelError(error))
-        throw CommandError(error.code == kCXDAVErrorAuthentication ? kRefused : kUnreachable, error.reason);
+    requireStore("What you may do there is not known.");
     const AccountOwner owner;
     bool read = false, write = false;
     const bool own = owner.userForRemoteLocation(location) == kSelf;

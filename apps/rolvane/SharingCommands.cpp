@@ -1,6 +1,8 @@
 #include "Context.h"
+#include "FailureText.h"
 #include "LeftOnStore.h"
 #include "Lookup.h"
+#include "PassReport.h"
 #include "Passes.h"
 #include "Publication.h"
 
@@ -56,9 +58,11 @@ void publish(Context& context, const PublishOptions& options) {
     Publication publication(database);
     const bool served = publication.anything();
 
-    CXDAVError error;
-    if (!CXDAVManager::canReachOstrelError(error) && error.code == kCXDAVErrorAuthentication)
-        throw CommandError(kRefused, error.reason + " Nothing was published.");
+    if (const auto failure = testStore()) {
+        const FailureText text = failureText(*failure, sceneOfTheAccount(Clock::system().now()));
+        if (text.code == kRefused)
+            throw CommandError(kRefused, text.what + " " + text.toDo + " Nothing was published.");
+    }
     removeWhatIsLeft(database, base);
 
     PassWatch watch(context, !context.quiet);
@@ -66,7 +70,7 @@ void publish(Context& context, const PublishOptions& options) {
     const bool changed = group ? publication.publishGroup(group, base) : publication.publishEverything(base);
     database.save();
     const int64_t position = database.journalPosition();
-    const Date saved = Clock::system().now();
+    OutcomeWatch outcomes(context);
     const std::string what = group ? fmt::format("The group \"{}\"", group->name()) : "The contact list";
     context.say(fmt::format("{} is published{} at {}.", what, changed ? "" : " already", base.absoluteString()));
     if (options.noDaemon) return;
@@ -78,11 +82,11 @@ void publish(Context& context, const PublishOptions& options) {
         daemon.start();
     if (options.noWait) return;
     if (!changed) return sync(context, options.timeout);
-    waitForPass(context, watch, "Publishing", position, saved, options.timeout);
+    PassOutcome outcome = waitForPass(context, watch, outcomes, "Publishing", position, options.timeout);
     // A pass that the restart ended in the middle may have left a lock or a record behind.
-    if (pendingChanges() > 0 && CXDAVManager::canReachOstrelError(error)) return sync(context, options.timeout);
-    reportPending(context);
-    if (context.exitCode == kOk) context.say("Everything is on the store.");
+    if (mayGoBetter(outcome)) outcome = makePass(context, options.timeout);
+    report(context, outcome, "Everything is on the store.", true);
+    if (context.json) context.print(outcomeJson(outcome));
 }
 
 // What is withdrawn, as the beginning of a sentence.

@@ -1,4 +1,6 @@
 #include "Context.h"
+#include "FailureText.h"
+#include "PassReport.h"
 #include "Passes.h"
 #include "Publication.h"
 #include "Subscriptions.h"
@@ -6,6 +8,7 @@
 #include "conduits/PublishedLayout.h"
 #include "daemon/DaemonControl.h"
 #include "engine/EngineState.h"
+#include "engine/StoreFailures.h"
 #include "foundation/Log.h"
 #include "model/RemoteLocationMap.h"
 #include "store/CXDAVManager.h"
@@ -19,7 +22,6 @@ namespace {
 using Json = nlohmann::ordered_json;
 
 constexpr const char* kSubscriptionListChanged = "CXSubscriptionListChanged";
-constexpr double kEndOfPassSeconds = 3;
 constexpr int kForbidden = 403;
 constexpr int kMissing = 404;
 
@@ -39,10 +41,8 @@ void requirePublication(const RemoteLocation& location) {
     int code = 0;
     const Url info = Url(location.str()).cxURLByAppendingComponent(layout::kInfo);
     if (CXDAVManager::defaultManager().dictionaryAtURL(info, false, &code)) return;
-    CXDAVError error;
-    if (!CXDAVManager::canReachOstrelError(error))
-        throw CommandError(error.code == kCXDAVErrorAuthentication ? kRefused : kUnreachable,
-                           error.reason + " Nothing was subscribed to.");
+    const std::vector<PassFailure> requests = takeFailures(CXDAVManager::defaultManager());
+    requireStore("Nothing was subscribed to.");
     if (code == kForbidden)
         throw CommandError(kRefused, fmt::format("The store does not let you read the contacts of \"{0}\". Check the "
                                                  "name, or ask for the right to read: `rolvane share {1}`, typed by "
@@ -52,10 +52,14 @@ void requirePublication(const RemoteLocation& location) {
         throw CommandError(kNotFound, fmt::format("\"{0}\" has published nothing on this store. Check the name, or ask "
                                                   "{0} to publish, with `rolvane publish`.",
                                                   user));
-    throw CommandError(code == 0 ? kUnreachable : kFailed,
-                       fmt::format("What \"{}\" has published could not be read ({}). Nothing was subscribed to; try "
-                                   "again later.",
-                                   user, code == 0 ? "the store did not answer" : fmt::format("it answered {}", code)));
+    FailureScene scene = sceneOfTheAccount(Clock::system().now());
+    scene.user = user;
+    scene.reads = true;
+    const FailureText text = requests.empty() ? FailureText{kUnreachable, "The store did not answer.", {}}
+                                              : failureText(requests.back(), scene);
+    throw CommandError(text.code, fmt::format("What \"{}\" has published could not be read. {} Nothing was subscribed "
+                                              "to; try again later.",
+                                              user, text.what));
 }
 
 Json described(CXRolvane& database, const CXSubscriptionRef& subscription) {
@@ -88,38 +92,32 @@ void startDaemonFor(PassWatch& watch, bool served) {
 }
 
 // Waits for the pass that brings the people, and tells what came.
-void waitForPeople(Context& context, PassWatch& watch, const RemoteLocation& location, int64_t position, Date saved,
-                   double seconds) {
+void waitForPeople(Context& context, PassWatch& watch, OutcomeWatch& outcomes, const RemoteLocation& location,
+                   int64_t position, double seconds) {
     CXRolvane& database = context.database();
     const std::string user = publisherOf(location);
-    waitForPass(context, watch, "Fetching", position, saved, seconds);
-    CXDAVError error;
-    const auto missing = [&] {
-        return database.findSubscriptionWithRemoteLocation(location) &&
-               (!wasRead(Preferences::shared(), location) || pendingChanges() > 0);
+    PassOutcome outcome = waitForPass(context, watch, outcomes, "Fetching", position, seconds);
+    const auto cameWhole = [&] {
+        const PassTree* tree = outcome.tree(UserName(user));
+        return isComplete(outcome) && tree && tree->in.reached && tree->in.waiting == 0;
     };
-    // What the daemon knows of the store is written down last in a pass.
-    const int stopped = watch.stopped();
-    watch.waitUntil([&] { return !missing() || watch.stopped() > stopped; }, std::min(seconds, kEndOfPassSeconds));
-    // The pass may have begun before the subscription, or may have been ended in the middle by the restart.
-    for (int again = 0; again < 2 && missing() && CXDAVManager::canReachOstrelError(error); ++again)
-        makePass(context, seconds);
+    // The pass may have carried changes alone, or may have been ended in the middle by the restart.
+    const auto goesOn = [&] { return outcome.storeReached && database.findSubscriptionWithRemoteLocation(location); };
+    for (int again = 0; again < 2 && !cameWhole() && goesOn(); ++again) outcome = makePass(context, seconds);
     const CXSubscriptionRef subscription = database.findSubscriptionWithRemoteLocation(location);
     if (!subscription)
         throw CommandError(kRefused, fmt::format("The store let go of the contacts of \"{}\" while they were fetched: "
                                                  "they are withdrawn, and the subscription has ended.",
                                                  user));
-    if (!wasRead(Preferences::shared(), location)) {
-        const bool reachable = CXDAVManager::canReachOstrelError(error);
-        throw CommandError(reachable ? kFailed : kUnreachable,
-                           fmt::format("The contacts of \"{}\" have not come yet: {} They come with a later pass.",
-                                       user, reachable ? "the store did not give all of them." : error.reason));
-    }
-    reportPending(context);
+    if (!cameWhole()) context.warn(fmt::format("Not all contacts of \"{}\" have come yet.", user));
+    const bool well = report(context, outcome, {});
     const Json data = described(database, subscription);
     if (context.json) context.print(data);
-    context.say(fmt::format("{} of \"{}\" are here; you may {}.", amount(data), user,
-                            data["writable"].get<bool>() ? "change them" : "read them but not change them"));
+    if (well && cameWhole())
+        context.say(fmt::format("{} of \"{}\" are here; you may {}.", amount(data), user,
+                                data["writable"].get<bool>() ? "change them" : "read them but not change them"));
+    else if (well)
+        context.exitCode = kFailed;
 }
 
 void subscribe(Context& context, const SubscribeOptions& options) {
@@ -142,11 +140,11 @@ void subscribe(Context& context, const SubscribeOptions& options) {
     database.addRecord(CXSubscription::create(location));
     database.save();
     const int64_t position = database.journalPosition();
-    const Date saved = Clock::system().now();
+    OutcomeWatch outcomes(context);
     context.say(fmt::format("You are subscribed to \"{}\" at {}.", user, location.str()));
     if (!options.noDaemon) startDaemonFor(watch, served);
     if (!options.noDaemon && !options.noWait)
-        waitForPeople(context, watch, location, position, saved, options.timeout);
+        waitForPeople(context, watch, outcomes, location, position, options.timeout);
     else if (context.json)
         context.print(described(database, database.findSubscriptionWithRemoteLocation(location)));
 }

@@ -310,7 +310,7 @@ complete -c rolvane -n '__rolvane_in status' -s q -l quiet -d 'No messages but e
 complete -c rolvane -n '__rolvane_in watch' -s h -l help -d 'Print this help message and exit'
 complete -c rolvane -n '__rolvane_in watch' -l json -d 'Print data as one JSON document'
 complete -c rolvane -n '__rolvane_in watch' -s q -l quiet -d 'No messages but errors'
-complete -c rolvane -n '__rolvane_in watch' -l once -d 'End with the first pass that ends'
+complete -c rolvane -n '__rolvane_in watch' -l once -d 'End with the first pass that ends, and with its exit code'
 complete -c rolvane -n '__rolvane_in watch' -l seconds -x -d 'End after so many seconds'
 complete -c rolvane -n '__rolvane_at defaults' -a read -d 'Show one value, or all of the domain'
 complete -c rolvane -n '__rolvane_at defaults' -a write -d 'Set a value; a running daemon reads most of them when it starts'

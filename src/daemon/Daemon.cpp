@@ -15,6 +15,7 @@
 #include "daemon/OwnPasses.h"
 #include "daemon/TerminationWatch.h"
 #include "engine/CXDSyncEngine.h"
+#include "engine/OutcomeKeeper.h"
 #include "engine/StoreFailures.h"
 #include "foundation/BootTime.h"
 #include "foundation/DaemonNotifications.h"
@@ -287,6 +288,7 @@ int runDaemon(int argc, char** argv) {
         daemon.serve();
     } catch (const CXException& exception) {
         CXLog("Quitting due to an unhandled exception: %@", exception);
+        OutcomeKeeper::endWithoutAPass(Preferences::shared(), Clock::system(), exception.reason()); // throws nothing
     }
     return 0;
 }

@@ -110,4 +110,11 @@ PassOutcome OutcomeKeeper::end() {
     return outcome;
 }
 
+PassOutcome OutcomeKeeper::endWithoutAPass(Preferences& preferences, const Clock& clock, const std::string& exception) {
+    OutcomeKeeper keeper(preferences, clock, {});
+    keeper.begin(true, false);
+    keeper.caught(exception);
+    return keeper.end();
+}
+
 } // namespace rolvane

@@ -44,6 +44,9 @@ public:
     // The pass has ended. What has changed since `put`, or was never put, is stored now. Any thread.
     PassOutcome end();
 
+    // For a process that came to no pass: puts down and gives an outcome that says why.
+    static PassOutcome endWithoutAPass(Preferences& preferences, const Clock& clock, const std::string& exception);
+
 private:
     void settle();
 

@@ -19,9 +19,17 @@ std::optional<PassFailure> failureBelow(const PassFacts& facts, const std::strin
     return last;
 }
 
+// Of the test of the store. The request that was in vain says more than the test as a whole.
+std::optional<PassFailure> storeFailure(const PassFacts& facts) {
+    if (!facts.storeFailure || facts.failures.empty()) return facts.storeFailure;
+    PassFailure failure = facts.failures.back();
+    failure.error = facts.storeFailure->error;
+    return failure;
+}
+
 // Why something is left in one direction: its own requests, else those of the other, else the store as a whole.
 std::optional<PassFailure> reason(const PassFacts& facts, const std::string& location, bool incoming) {
-    if (!facts.storeReached && facts.storeFailure) return facts.storeFailure;
+    if (!facts.storeReached && facts.storeFailure) return storeFailure(facts);
     auto found = failureBelow(facts, location, incoming);
     return found ? found : failureBelow(facts, location, !incoming);
 }
@@ -56,7 +64,7 @@ PassOutcome outcomeOf(const PassFacts& facts, const std::optional<PassOutcome>& 
     outcome.full = facts.full;
     outcome.storeReached = facts.storeReached;
     outcome.anotherFollows = facts.anotherFollows;
-    outcome.storeFailure = facts.storeFailure;
+    outcome.storeFailure = storeFailure(facts);
     outcome.exception = facts.exception;
     outcome.storage = facts.storage;
 

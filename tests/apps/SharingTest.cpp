@@ -203,7 +203,8 @@ TEST_F(Sharing, WatchEndsWithThePassAndTellsItsProgress) {
     std::vector<nlohmann::json> events;
     for (std::string line; std::getline(lines, line);) events.push_back(nlohmann::json::parse(line));
     ASSERT_GE(events.size(), 3U) << watching->output();
-    EXPECT_EQ(events.back()["event"], "stopped");
+    EXPECT_EQ(events.back()["event"], "ended");
+    EXPECT_EQ(events.back()["pass"]["sent"], true);
     bool progress = false;
     for (const auto& event : events)
         if (event["event"] == "progress") {

@@ -234,7 +234,9 @@ TEST_F(Subscribing, WhatIsWithdrawnLeavesIsKeptAndCanBeTakenBack) {
     world.done({"share", "bob"});
     bob.done({"subscribe", "alice"});
     world.done({"unshare", "bob"});
-    bob.done({"sync"});
+    const Ran sync = bob.rolvane({"sync"});
+    EXPECT_EQ(sync.status, kNotAllowed) << sync;
+    EXPECT_NE(sync.errors.find("alice no longer shares with you"), std::string::npos) << sync;
     EXPECT_TRUE(nothingIsNoted());
     EXPECT_EQ(bob.json({"list"}), nlohmann::json::array());
     const auto kept = bob.json({"status"})["withdrawn"];

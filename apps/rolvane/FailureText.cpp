@@ -1,0 +1,156 @@
+#include "FailureText.h"
+
+#include "engine/StoreFailures.h"
+#include "store/CXDAVManager.h"
+
+#include <fmt/format.h>
+
+namespace rolvane::cli {
+
+namespace {
+
+constexpr const char* kByItself = "The daemon tries again by itself.";
+
+std::string quoted(const std::string& words) {
+    return words.empty() ? std::string() : " (\"" + words + "\")";
+}
+
+std::string nameOf(const FailureScene& scene) {
+    return scene.store.empty() ? "the store" : scene.store;
+}
+
+std::string until(const PassFailure& failure, const FailureScene& scene) {
+    if (!failure.retryAfterSeconds) return kByItself;
+    return fmt::format("It wants to be asked again at {}; the daemon does so by itself.",
+                       scene.at.addingSeconds(*failure.retryAfterSeconds).toISO8601());
+}
+
+FailureText password(const FailureScene& scene, const std::string& words) {
+    return {
+        kRefused,
+        fmt::format("{} refused the user name or the password of \"{}\"{}.", nameOf(scene), scene.self, quoted(words)),
+        "If the password was changed there, type `rolvane account set --ask-password`: the daemon then goes on by "
+        "itself."};
+}
+
+// Without an answer that can be believed.
+FailureText unanswered(const PassFailure& failure, const FailureScene& scene) {
+    const std::string store = nameOf(scene);
+    const std::string asked = failure.method.empty() ? "" : fmt::format(" (asked for {})", failure.method);
+    switch (failure.error) {
+    case kCXDAVErrorTimedOut:
+        return {kUnreachable, fmt::format("{} did not answer in time{}.", store, asked), kByItself};
+    case kCXDAVErrorSecureConnection:
+        return {kUnreachable, fmt::format("There is no secure connection to {}{}.", store, quoted(failure.words)),
+                "Check the account's authority, with `rolvane account set --ca-file FILE`, and the host's name in the "
+                "endpoint. Nothing was sent."};
+    case kCXDAVErrorBadServerResponse:
+        return {kUnreachable,
+                fmt::format("Whoever answers for {} is no WebDAV server{}{}.", store, asked, quoted(failure.words)),
+                "Where the network has a page to sign in, sign in there; else check the account's endpoint. "
+                "`rolvane account show` tells it."};
+    case kCXDAVErrorAuthentication: return password(scene, failure.words);
+    case kCXDAVErrorNoPassword:
+        return {kRefused, fmt::format("The password of \"{}\" cannot be had{}.", scene.self, quoted(failure.words)),
+                "`rolvane account test` says why, `rolvane account set --ask-password` takes it anew."};
+    case kCXDAVErrorNoAccount: return {kFailed, "There is no account on a store.", "`rolvane account set` makes one."};
+    case kCXDAVErrorCannotConnect: {
+        const bool unknownName = failure.words.find("resolve") != std::string::npos;
+        return {kUnreachable, fmt::format("{} cannot be reached{}.", store, quoted(failure.words)),
+                unknownName
+                    ? "Is this machine on the network? If it is, check the host's name in the account's "
+                      "endpoint: `rolvane account show` tells it."
+                    : "Look whether it runs, and whether this machine is on the network. " + std::string(kByItself)};
+    }
+    default: return {kUnreachable, fmt::format("{} could not be used{}.", store, quoted(failure.words)), kByItself};
+    }
+}
+
+FailureText forbidden(const PassFailure& failure, const FailureScene& scene) {
+    const std::string what = fmt::format("The store does not allow {} (403){}.", failure.method, quoted(failure.words));
+    if (scene.user.empty()) return {kRefused, what, "Have the store's administrator let you use your own tree."};
+    return {kRefused, what,
+            fmt::format("Ask {} for `rolvane share {}{}`.", scene.user, scene.self, scene.reads ? "" : " --write")};
+}
+
+} // namespace
+
+FailureText failureText(const PassFailure& failure, const FailureScene& scene) {
+    if (failure.status == 0) return unanswered(failure, scene);
+    if (failure.status == 401) return password(scene, failure.words);
+    if (failure.status == 403) return forbidden(failure, scene);
+    const auto answered = [&](const char* meaning) {
+        return fmt::format("The store answered {} with {}{}{}.", failure.method, failure.status, meaning,
+                           quoted(failure.words));
+    };
+    switch (failure.status) {
+    case 404:
+    case 409:
+        return {kFailed, answered(": the folder above is missing there"),
+                "The next pass makes the tree whole. If it is told again, check the account's endpoint, and have the "
+                "store's administrator look at the folder."};
+    case 405:
+    case 501:
+        return {kFailed, answered(": it does not know this there"),
+                "Check the account's endpoint: WebDAV has to be switched on for the whole tree."};
+    case 408: return {kUnreachable, answered(": it waited too long"), kByItself};
+    case 412:
+        return {kFailed, answered(": somebody else has changed the same at this moment"),
+                "The next pass looks at both and tries again."};
+    case 413:
+        return {kFailed, answered(": that is too large for it"),
+                "Have its administrator allow larger files, or make the contact's photo smaller."};
+    case 423:
+        return {kFailed, answered(": somebody else holds the lock of the tree"),
+                "The daemon tries again by itself; a lock that nobody gives back ends after five minutes."};
+    case 429:
+    case 503: return {kUnreachable, answered(": it is too busy"), until(failure, scene)};
+    case 507:
+        return {kFailed, answered(": it has no room left"),
+                "Make room there, or have the quota raised; the daemon tries again by itself."};
+    default: break;
+    }
+    if (failure.status >= 500)
+        return {kUnreachable, answered(": it has failed"),
+                "The daemon tries again by itself. If it goes on, the store's administrator finds the reason in its "
+                "log."};
+    return {kFailed, answered(""), kByItself};
+}
+
+FailureScene sceneOfTheAccount(Date at) {
+    const CXDAVAccount& account = CXDAVManager::defaultManager().account();
+    const std::vector<std::string> origins = account.user.empty() ? std::vector<std::string>() : account.origins();
+    return {origins.empty() ? std::string() : origins.front(), account.user.str(), {}, false, at};
+}
+
+std::optional<PassFailure> testStore() {
+    CXDAVManager& store = CXDAVManager::defaultManager();
+    CXDAVError error;
+    (void)takeFailures(store);
+    if (store.canReach(error)) return std::nullopt;
+    const std::vector<PassFailure> requests = takeFailures(store);
+    PassFailure failure = requests.empty() ? PassFailure{{}, {}, 0, 0, error.reason, std::nullopt} : requests.back();
+    failure.error = error.code;
+    return failure;
+}
+
+void requireStore(const std::string& nothingDone) {
+    const auto failure = testStore();
+    if (!failure) return;
+    const FailureText text = failureText(*failure, sceneOfTheAccount(Clock::system().now()));
+    throw CommandError(text.code, text.what + " " + text.toDo + " " + nothingDone);
+}
+
+nlohmann::ordered_json failureJson(const PassFailure& failure, const FailureScene& scene) {
+    using Json = nlohmann::ordered_json;
+    const FailureText text = failureText(failure, scene);
+    return {{"method", failure.method.empty() ? Json() : Json(failure.method)},
+            {"url", failure.url.empty() ? Json() : Json(failure.url)},
+            {"status", failure.status == 0 ? Json() : Json(failure.status)},
+            {"words", failure.words},
+            {"retryAfter", failure.retryAfterSeconds ? Json(*failure.retryAfterSeconds) : Json()},
+            {"what", text.what},
+            {"toDo", text.toDo}};
+}
+
+} // namespace rolvane::cli
