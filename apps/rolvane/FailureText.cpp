@@ -79,6 +79,9 @@ FailureText failureText(const PassFailure& failure, const FailureScene& scene) {
     if (failure.status == 0) return unanswered(failure, scene);
     if (failure.status == 401) return password(scene, failure.words);
     if (failure.status == 403) return forbidden(failure, scene);
+    // A page of somebody else's, whatever its status.
+    const bool isBusy = failure.status >= 500 || failure.status == 408 || failure.status == 429;
+    if (failure.error == kCXDAVErrorBadServerResponse && !isBusy) return unanswered(failure, scene);
     const auto answered = [&](const char* meaning) {
         return fmt::format("The store answered {} with {}{}{}.", failure.method, failure.status, meaning,
                            quoted(failure.words));

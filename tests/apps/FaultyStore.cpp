@@ -2,8 +2,18 @@
 
 namespace rolvane::test {
 
+namespace {
+
+CurlTransportOptions trusting(const std::string& caFile) {
+    CurlTransportOptions options;
+    options.caFile = caFile;
+    return options;
+}
+
+} // namespace
+
 FaultyStore::FaultyStore(CommandWorld& world)
-    : _upstream({world.store().caFile(), "FaultyStore"}), _origin(world.store().baseURL()),
+    : _upstream(trusting(world.store().caFile())), _origin(world.store().baseURL()),
       _secure(world.store().endpointTemplate()), _server([this](const FakeRequest& request) {
           Fault fault;
           {

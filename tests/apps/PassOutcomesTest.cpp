@@ -29,9 +29,9 @@ protected:
                                     "RewriteEngine on"};
         for (const int status : kStatuses) {
             const std::string number = std::to_string(status);
-            for (const std::string& line :
-                 {"RewriteCond %{REQUEST_METHOD} =PUT", "RewriteCond " + faultPath(status) + " -f",
-                  "RewriteRule ^ - [R=" + number + ",L]", "ErrorDocument " + number + " \"the server's own words\""})
+            for (const std::string& line : std::vector<std::string>{
+                     "RewriteCond %{REQUEST_METHOD} =PUT", "RewriteCond " + faultPath(status) + " -f",
+                     "RewriteRule ^ - [R=" + number + ",L]", "ErrorDocument " + number + " \"the server's own words\""})
                 world.storeConfiguration.push_back(line);
         }
         world.bus();
@@ -153,8 +153,8 @@ TEST_F(Outcomes, WhatWaitsIsToldWithTheMethodTheStatusAndWhatToDo) {
         const Ran ran = world.rolvane({"sync"});
         EXPECT_EQ(ran.status, each.code) << ran;
         EXPECT_FALSE(claimsSuccess(ran));
-        for (const std::string part : {std::string("PUT"), std::to_string(each.status),
-                                       std::string("the server's own words"), std::string(each.toDo)})
+        for (const std::string& part : {std::string("PUT"), std::to_string(each.status),
+                                        std::string("the server's own words"), std::string(each.toDo)})
             EXPECT_TRUE(says(ran, part)) << part << "\n" << ran;
         const Ran status = world.rolvane({"status"});
         EXPECT_TRUE(says(status, "PUT with " + std::to_string(each.status))) << status;
