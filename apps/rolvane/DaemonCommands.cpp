@@ -143,7 +143,13 @@ Json status(Context& context) {
                                  {"location", s->remoteLocation().str()},
                                  {"writable", s->isWritable()}});
     const auto pid = DaemonControl().running();
-    const auto outcome = lastOutcome(preferences);
+    auto outcome = lastOutcome(preferences);
+    if (outcome) // without what has been withdrawn, or is subscribed to no more, since
+        std::erase_if(outcome->trees, [&](const PassTree& tree) {
+            if (tree.ended) return false;
+            if (tree.user == kSelf) return !publication.anything();
+            return !database.findSubscriptionWithRemoteLocation(RemoteLocation(tree.location));
+        });
     const bool shares = publication.anything() || !subscriptions.empty();
     return {{"people", database.countPeople(RemoteLocation(""))},
             {"groups", database.listGroups(RemoteLocation("")).size()},
