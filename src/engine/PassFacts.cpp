@@ -74,10 +74,10 @@ PassOutcome outcomeOf(const PassFacts& facts, const std::optional<PassOutcome>& 
     else if (previous)
         for (const PassTree& tree : previous->trees)
             if (!tree.ended) shared.push_back({tree.user, tree.location, tree.listsWait});
-    for (const auto& [user, look] : facts.looks) { // what has ended is in the database no more
+    for (const auto& entry : facts.looks) { // what has ended is in the database no more
         const bool known =
-            std::any_of(shared.begin(), shared.end(), [&](const auto& each) { return each.user == user; });
-        if (!known && look == TreeLook::ended) shared.push_back({user, {}, false});
+            std::any_of(shared.begin(), shared.end(), [&](const auto& each) { return each.user == entry.first; });
+        if (!known && entry.second == TreeLook::ended) shared.push_back({entry.first, {}, false});
     }
 
     for (const PassFacts::Shared& each : shared) {
