@@ -74,7 +74,10 @@ CXDAVManager::CXDAVManager(CXDAVAccount account, VersionsFile versions) {
 }
 
 CXDAVManager::CXDAVManager(CXDAVAccount account, std::shared_ptr<HttpTransport> transport)
-    : _impl(std::make_shared<Impl>(std::move(account), std::move(transport), nullptr, std::string())) {}
+    : CXDAVManager(std::move(account), std::move(transport), VersionsFile()) {}
+
+CXDAVManager::CXDAVManager(CXDAVAccount account, std::shared_ptr<HttpTransport> transport, VersionsFile versions)
+    : _impl(std::make_shared<Impl>(std::move(account), std::move(transport), nullptr, std::move(versions.path))) {}
 
 CXDAVManager::~CXDAVManager() {
     _impl->versions.save();

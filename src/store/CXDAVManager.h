@@ -59,7 +59,9 @@ public:
     // Credentials are fetched from the account's password source on first need.
     explicit CXDAVManager(CXDAVAccount account); // over a CurlTransport of its own
     CXDAVManager(CXDAVAccount account, VersionsFile versions);
-    CXDAVManager(CXDAVAccount account, std::shared_ptr<HttpTransport>); // over the given transport, which signs in
+    // Over the given transport, which signs in.
+    CXDAVManager(CXDAVAccount account, std::shared_ptr<HttpTransport> transport);
+    CXDAVManager(CXDAVAccount account, std::shared_ptr<HttpTransport> transport, VersionsFile versions);
     ~CXDAVManager() override;
 
     // -- the process's own client, built from the saved account on first use; never null. Without an account (or with

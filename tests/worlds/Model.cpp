@@ -1,0 +1,131 @@
+#include "Model.h"
+
+#include <algorithm>
+
+namespace rolvane::worlds {
+
+namespace {
+
+// The contact or group that a part of a group is about; "" for other parts.
+std::string othersName(const std::string& cell) {
+    for (const char* kind : {"Member/", "Group/"})
+        if (cell.starts_with(kind)) return cell.substr(std::string(kind).size());
+    return {};
+}
+
+} // namespace
+
+void Model::take(const Deed& deed) {
+    ++deeds;
+    Thing& thing = _things[deed.thing];
+    _recent[deed.who].push_back({deed.thing, deed.cell, deed.kind});
+    switch (deed.kind) {
+    case Deed::Kind::makePerson:
+    case Deed::Kind::makeGroup: thing.isGroup = deed.kind == Deed::Kind::makeGroup; return;
+    case Deed::Kind::remove: thing.removed = true; return;
+    case Deed::Kind::set: break;
+    }
+    thing.editors.insert(deed.who);
+    Cell& cell = thing.cells[deed.cell];
+    if (cell.history.empty()) cell.history[""] = 1;
+    // A value that was set more than once may have been seen as it was long ago, so it is not certain to be replaced.
+    const bool sawThatVery = cell.history[deed.before] == 1;
+    std::erase_if(cell.heads,
+                  [&](const Value& head) { return head.who == deed.who || (sawThatVery && head.text == deed.before); });
+    if (!cell.heads.empty()) ++conflicts;
+    cell.heads.push_back({deed.who, deed.after});
+    ++cell.history[deed.after];
+}
+
+void Model::settled(char who) {
+    _recent[who].clear();
+}
+
+void Model::refused(char who) {
+    for (const Recent& recent : _recent[who]) {
+        Thing& thing = _things[recent.thing];
+        if (recent.kind == Deed::Kind::set)
+            thing.cells[recent.cell].anything = true;
+        else
+            thing.mayBeMissing = thing.mayBeThere = true;
+    }
+}
+
+const Model::Thing* Model::known(const std::string& thing) const {
+    const auto found = _things.find(thing);
+    return found == _things.end() ? nullptr : &found->second;
+}
+
+bool Model::mustBeAbsent(const std::string& name) const {
+    const Thing* thing = known(name);
+    return !thing || (thing->removed && !thing->mayBeThere);
+}
+
+// Whether the inner group may have been seen to hold the outer one, over others perhaps: of two people who list two
+// groups in each other one has to give way.
+bool Model::couldCloseACircle(const std::string& outer, const std::string& inner) const {
+    std::set<std::string> seen;
+    std::vector<std::string> next{inner};
+    while (!next.empty()) {
+        const std::string name = next.back();
+        next.pop_back();
+        if (name == outer) return true;
+        if (!seen.insert(name).second) continue;
+        if (const Thing* group = known(name))
+            for (const auto& [cell, state] : group->cells)
+                if (cell.starts_with("Group/") && state.history.contains("1")) next.push_back(othersName(cell));
+    }
+    return false;
+}
+
+bool Model::mayStand(const std::string& name, const Thing& thing, const std::string& cell,
+                     const std::string& value) const {
+    const Cell& state = thing.cells.at(cell);
+    if (const std::string other = othersName(cell); !other.empty()) {
+        if (mustBeAbsent(other)) return value.empty();
+        const Thing* member = known(other);
+        if (member->mayBeMissing && value.empty()) return true;
+        if (cell.starts_with("Group/") && value.empty() && couldCloseACircle(name, other)) return true;
+    }
+    const bool any = state.anything || (!mergesProperties && thing.editors.size() > 1);
+    if (any && state.history.contains(value)) return true;
+    return std::any_of(state.heads.begin(), state.heads.end(), [&](const Value& head) { return head.text == value; });
+}
+
+void Model::judge(const std::string& name, const Thing& thing, const Cells* there,
+                  std::vector<std::string>& out) const {
+    if (!there) {
+        if (!thing.removed && !thing.mayBeMissing) out.push_back(name + " is missing, and nobody removed it");
+        return;
+    }
+    if (thing.removed && !thing.mayBeThere) {
+        out.push_back(name + " is there, and was removed");
+        return;
+    }
+    for (const auto& [cell, state] : thing.cells) {
+        const auto found = there->find(cell);
+        const std::string value = found == there->end() ? "" : found->second;
+        if (mayStand(name, thing, cell, value)) continue;
+        std::string wanted;
+        for (const Value& head : state.heads) wanted += " \"" + head.text + "\" of " + head.who;
+        out.push_back(name + " " + cell + " is \"" + value + "\", not" + wanted);
+    }
+    for (const auto& [cell, value] : *there)
+        if (!value.empty() && !thing.cells.contains(cell))
+            out.push_back(name + " " + cell + " is \"" + value + "\", which nobody wrote");
+}
+
+std::vector<std::string> Model::differences(const View& view) const {
+    std::vector<std::string> out = view.faults;
+    for (const auto& [name, thing] : _things) {
+        const auto& all = thing.isGroup ? view.groups : view.people;
+        const auto found = all.find(name);
+        judge(name, thing, found == all.end() ? nullptr : &found->second, out);
+    }
+    for (const auto* all : {&view.people, &view.groups})
+        for (const auto& [name, cells] : *all)
+            if (!known(name)) out.push_back(name + " is there, and nobody made it");
+    return out;
+}
+
+} // namespace rolvane::worlds
