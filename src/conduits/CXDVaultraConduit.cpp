@@ -288,6 +288,7 @@ bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state)
 void CXDVaultraConduit::mendOwnTree(const Dictionary& prior, const Dictionary& state) {
     if (_isWrittenByOthers) _leftovers = removalOfUnlisted(prior, state);
     if (!allGroupHas(kCXRemoteLocationProperty)) return; // the list may be older than the withdrawal
+    if (_isWrittenByOthers) takeNamesAloneOut(prior, state);
     size_t written = 0;
     for (const UniqueId& name : contactsThatAreMissing(state)) {
         const CXRecordRef person = _world.rolvane.recordForUniqueId(cxUIDWithTableName(name, kCXPersonTable));
@@ -299,6 +300,19 @@ void CXDVaultraConduit::mendOwnTree(const Dictionary& prior, const Dictionary& s
         ++written;
     }
     if (written > 0) CXLog("The store has lost the files of %@ contacts, which are written again.", written);
+}
+
+// Groups that name a contact which is nowhere.
+void CXDVaultraConduit::takeNamesAloneOut(Dictionary prior, const Dictionary& state) {
+    const Dictionary alone = namesAlone(prior, state, [&](const UniqueId& person) {
+        return _world.rolvane.recordForUniqueId(cxUIDWithTableName(person, kCXPersonTable)) != nullptr;
+    });
+    const CXDChangeRecords removals = removalOfNamesAlone(prior, alone);
+    _leftovers.insert(_leftovers.end(), removals.begin(), removals.end());
+    if (alone.empty())
+        prior.remove(kNamesAlone);
+    else
+        prior.set(kNamesAlone, alone);
 }
 
 // True when nothing had to be mended, or has been long since. When the last of it is on the store: where nobody but the

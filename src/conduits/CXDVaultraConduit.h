@@ -119,6 +119,7 @@ private:
     bool isMended(const Dictionary& prior, const Dictionary& state);
     bool isToBePublishedAgain();
     void mendOwnTree(const Dictionary& prior, const Dictionary& state);
+    void takeNamesAloneOut(Dictionary prior, const Dictionary& state);
     bool somebodyMayWrite(); // besides the owner
     bool allGroupHas(const char* property);
     void leaveUnlistedOut(CXDChangeRecords& records);

@@ -121,6 +121,37 @@ CXDChangeRecords removalOfUnlisted(const Dictionary& prior, const Dictionary& cu
     return removals;
 }
 
+Dictionary namesAlone(const Dictionary& prior, const Dictionary& current,
+                      const std::function<bool(const UniqueId& person)>& isHere) {
+    Dictionary alone;
+    if (!current[kEverybody].dictionary().contains(kMemberUIDState)) return alone;
+    const ListedContacts listed(current), listedBefore(prior);
+    const Dictionary files = current[kPeopleState].dictionary()[kMemberUIDState].dictionary();
+    for (const auto& [name, state] : current) {
+        if (!isGroup(name) || name == kEverybody) continue;
+        Array names;
+        for (const Value& member : state.dictionary()[kMemberUIDState].array()) {
+            const UniqueId person(member.string());
+            if (listed.contains(person) || files.contains(person.str())) continue;
+            if (listedBefore.contains(person) || !isHere(person)) names.append(member);
+        }
+        if (!names.empty()) alone.set(name, names);
+    }
+    return alone;
+}
+
+CXDChangeRecords removalOfNamesAlone(const Dictionary& prior, const Dictionary& alone) {
+    CXDChangeRecords removals;
+    if (alone.empty()) return removals;
+    const ListedContacts listedBefore(prior);
+    const Dictionary before = prior[kNamesAlone].dictionary();
+    for (const auto& [group, names] : alone)
+        for (const Value& name : names.array())
+            if (listedBefore.contains(UniqueId(name.string())) || before[group].array().containsString(name.string()))
+                removals.push_back(ownersChange(CXDRemoveRecordFromGroup, UniqueId(name.string()), UniqueId(group)));
+    return removals;
+}
+
 CXDChangeRecordPtr removalOfContact(const UniqueId& person) {
     return ownersChange(CXDDeleteRecord, person, std::nullopt);
 }

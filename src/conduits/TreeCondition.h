@@ -4,6 +4,7 @@
 #include "foundation/Value.h"
 #include "model/CXDChangeRecord.h"
 
+#include <functional>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -22,6 +23,7 @@
 namespace rolvane {
 
 inline constexpr const char* kTreeDates = "TreeDates";
+inline constexpr const char* kNamesAlone = "NamesAlone"; // as namesAlone gives them
 
 struct TreeCondition {
     enum class Kind {
@@ -52,7 +54,17 @@ CXDChangeRecords removalOfLeftovers(const Dictionary& prior, const Dictionary& c
 // longer, and still lies there: another writer has taken it out, and a change that was under way brought its file back.
 CXDChangeRecords removalOfUnlisted(const Dictionary& prior, const Dictionary& current);
 
-// The same of one contact.
+// Whom groups name though neither the list of everybody nor a file does: group -> array of people. Somebody has put the
+// contact there while somebody else deleted it; or a new contact's file is still to come. `isHere`: the owner's
+// database has the contact; one whom the list has lost since `prior` is about to leave it.
+Dictionary namesAlone(const Dictionary& prior, const Dictionary& current,
+                      const std::function<bool(const UniqueId& person)>& isHere);
+
+// The changes of the owner's that take such names out of their groups: whom the list of everybody has lost since
+// `prior`, and who stood alone at the last visit already ("NamesAlone" of `prior`).
+CXDChangeRecords removalOfNamesAlone(const Dictionary& prior, const Dictionary& alone);
+
+// The change that takes one contact off the store.
 CXDChangeRecordPtr removalOfContact(const UniqueId& person);
 
 // The contacts that the list of everybody names and that are nowhere in the tree. Looks at nothing but two counts while

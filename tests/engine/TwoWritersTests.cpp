@@ -18,6 +18,10 @@ protected:
         return std::dynamic_pointer_cast<CXGroup>(
             bob.application->recordForUniqueId(cxUIDWithTableName(group->uniqueId(), kCXSubscribedGroupTable)));
     }
+    Dictionary stateOf(const UniqueId& group) {
+        const std::filesystem::path place = world->file(group.str());
+        return contentOf(std::filesystem::is_directory(place) ? place / CXDAVManager::kStateName : place);
+    }
     CXGroupRef circleOfBoth() {
         const CXGroupRef circle = alice.group("Circle", {people[0]});
         alice.pass();
@@ -233,6 +237,47 @@ TEST_F(TwoWriters, AContactsFileThatTheStoreHasLostIsWrittenAgainByItsOwner) {
     for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
 }
 
+// One deletes a contact, and the other one, who has not heard of it, puts it into a group.
+TEST_F(TwoWriters, ADeletedContactIsNamedByNoGroupWhoeverHasPutItThere) {
+    const CXGroupRef circle = circleOfBoth();
+    const UniqueId byOwner = people[0]->uniqueId(), byWriter = people[1]->uniqueId();
+    bob.application->removeRecord(bob.copyOf(people[0]));
+    friends->removeMember(people[0]);
+    alice.application->removeRecord(alice.application->recordForUniqueId(byWriter));
+    const CXGroupRef made = alice.group("Made", {people[0]});
+    alice.application->save();
+    copyOf(circle)->addMember(bob.copyOf(people[1]));
+    bob.application->save();
+    for (int round = 0; round < 3; ++round)
+        for (Participant* each : {&alice, &bob}) each->pass();
+    EXPECT_EQ(copies(), alice.view()) << log.text();
+    for (const CXGroupRef& group : {circle, made, friends})
+        for (const Value& member : stateOf(group->uniqueId())["memberUIDState"].array())
+            EXPECT_TRUE(member.string() != byOwner.str() && member.string() != byWriter.str()) << group->name();
+    for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
+}
+
+// The writer's daemon writes what was saved without a look at the list of everybody.
+TEST_F(TwoWriters, AContactThatWasDeletedLongAgoIsNamedByNoGroupIntoWhichAWriterPutsIt) {
+    const CXGroupRef circle = circleOfBoth();
+    const UniqueId gone = people[1]->uniqueId();
+    alice.application->removeRecord(people[1]);
+    alice.application->save();
+    alice.pass();
+    copyOf(circle)->addMember(bob.copyOf(people[1]));
+    bob.application->save();
+    auto change = std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, CXDAddRecordToGroup, UserName("alice"), gone,
+                                                    circle->uniqueId());
+    change->setAppliesToSources(CXDSyncSourceVaultra);
+    bob.engine->applyChangeRecords({change}, true);
+    ASSERT_TRUE(stateOf(circle->uniqueId())["memberUIDState"].array().containsString(gone.str()));
+    for (int round = 0; round < 2; ++round)
+        for (Participant* each : {&alice, &bob}) each->pass();
+    EXPECT_FALSE(stateOf(circle->uniqueId())["memberUIDState"].array().containsString(gone.str())) << log.text();
+    EXPECT_EQ(copies(), alice.view()) << log.text();
+    for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
+}
+
 TEST_F(TwoWriters, WhoJoinsASingleGroupThatIsPublishedArrives) {
     CXMutableMultiValue locations;
     locations.addValue(alice.base, kCXPublishLabel);
@@ -294,9 +339,7 @@ TEST_F(TwoWriters, AfterFiveHundredEditsEachBothDatabasesAndTheStoreAreEqual) {
         EXPECT_TRUE(written[uid].contains(firstName(each).string())) << uid << " " << firstName(each).string();
     }
     for (const CXGroupRef& each : circles) {
-        const std::filesystem::path place = world->file(each->uniqueId().str());
-        const Dictionary state =
-            contentOf(std::filesystem::is_directory(place) ? place / CXDAVManager::kStateName : place);
+        const Dictionary state = stateOf(each->uniqueId());
         std::set<std::string> here, there;
         for (const UniqueId& member : each->memberUniqueIds()) here.insert(cxNormalizedUID(member).str());
         for (const Value& member : state["memberUIDState"].array()) there.insert(member.string());

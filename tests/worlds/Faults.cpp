@@ -84,20 +84,25 @@ FaultyTransport::Decision FaultyTransport::decide(const HttpRequest& request) {
         decision.fate = chance.happens(0.5) ? Fate::killBefore : Fate::killAfter;
         return decision;
     }
-    if (_weather.storeAwayFrom >= 0 && number >= _weather.storeAwayFrom) {
+    const bool spared = _weather.without.contains("locks") && (request.method == "LOCK" || request.method == "UNLOCK");
+    if (_weather.storeAwayFrom >= 0 && !spared && number >= _weather.storeAwayFrom) {
         decision.kind = _weather.portal ? "away, portal" : "away";
         decision.answer = _weather.portal ? page() : broken(TransportError::unreachable, "away");
         decision.fate = Fate::answered;
         return decision;
     }
-    if (!chance.happens(_weather.faults)) return decision;
+    if (!chance.happens(_weather.faults) || spared) return decision;
     decision.answer = answerOf(request, chance, decision.kind);
-    if (decision.answer) {
+    if (_weather.without.contains(decision.kind)) {
+        decision.answer.reset();
+        decision.kind.clear();
+    } else if (decision.answer) {
         decision.fate = Fate::answered;
     } else {
         const bool cut = chance.happens(0.5);
         decision.fate = cut ? Fate::cutAnswer : Fate::lostAnswer;
         decision.kind = cut ? "cut answer" : "lost answer";
+        if (_weather.without.contains(decision.kind)) decision = Decision{Fate::pass, decision.name, {}, {}};
     }
     return decision;
 }

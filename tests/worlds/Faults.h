@@ -9,6 +9,7 @@
 #include <memory>
 #include <mutex>
 #include <optional>
+#include <set>
 #include <string>
 
 namespace rolvane::worlds {
@@ -17,15 +18,16 @@ namespace rolvane::worlds {
 // often that was asked already, so it does not depend on the order in which threads ask.
 struct Weather {
     uint64_t seed = 0;
-    double faults = 0;          // of the requests that meet one
-    double kill = 0;            // that the process is killed before or after a request
-    int killBeforeWrite = -1;   // to a file of the daemon's; -1: never
-    int diskFullFrom = -1;      // write to a file of the daemon's; -1: never
-    int diskFullFor = 0;        // writes
-    int storeAwayFrom = -1;     // request; -1: never
-    bool portal = false;        // while it is away somebody else answers
-    bool refusesWriter = false; // a fault may be a refusal of a write to somebody else's tree
-    std::string ownTree;        // the path of the person's own
+    double faults = 0;             // of the requests that meet one
+    double kill = 0;               // that the process is killed before or after a request
+    int killBeforeWrite = -1;      // to a file of the daemon's; -1: never
+    int diskFullFrom = -1;         // write to a file of the daemon's; -1: never
+    int diskFullFor = 0;           // writes
+    int storeAwayFrom = -1;        // request; -1: never
+    bool portal = false;           // while it is away somebody else answers
+    bool refusesWriter = false;    // a fault may be a refusal of a write to somebody else's tree
+    std::string ownTree;           // the path of the person's own
+    std::set<std::string> without; // kinds of faults that do not happen; "locks": none at LOCK and UNLOCK
 };
 
 // Sends requests on, or answers in the store's place, or loses the answer, or ends the process.

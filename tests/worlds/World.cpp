@@ -250,6 +250,7 @@ Weather World::weather() {
     made.seed = _chance.next();
     made.faults = _chance.happens(0.8) ? _climate.faults : 0;
     made.refusesWriter = _climate.refusals;
+    made.without = _options.without;
     if (_chance.happens(_climate.kills)) {
         if (_chance.happens(0.6))
             made.kill = _chance.happens(0.5) ? 0.02 : 0.08;
@@ -258,7 +259,7 @@ Weather World::weather() {
     }
     if (_chance.happens(_climate.outages)) {
         made.storeAwayFrom = _chance.happens(0.4) ? 0 : static_cast<int>(_chance.below(50));
-        made.portal = _chance.happens(0.25);
+        made.portal = _chance.happens(0.25) && with("portal");
     }
     if (_chance.happens(_climate.fullDisks)) {
         made.diskFullFrom = static_cast<int>(_chance.below(60));
@@ -311,6 +312,7 @@ void World::clean(char role) {
         calm.ownTree = "/dav/" + person(role).account.user.str() + "/";
         Daemon daemon(person(role), calm, report);
         daemon.pass();
+        daemon.deliver(); // as the program does when its run loop turns
         if (daemon.nothingWaits()) report.line(lines::kSettled);
     });
 }

@@ -29,7 +29,8 @@ table; exit status 1 when anything differs.
   --seeds    which worlds (1..20)
   --jobs     how many at a time (1)
   --without  leaves out: kills, faults, outages, disks, refusals, nesting, writer, overlap,
-             last: the last contact is never deleted, and merging: where both have edited one contact either version may stand
+             last: the last contact is never deleted, single kinds of faults: 500, 503, 412, 423, 403, 404, reset,
+             time-out, portal, "lost answer", "cut answer", and locks: those at LOCK and UNLOCK, and merging: where both have edited one contact either version may stand
   --steps    how many steps a world has, instead of as its seed says
   --keep     where the files and the story of each world that differs are put; with --keep-all, of every one
 )";
