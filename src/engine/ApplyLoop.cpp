@@ -183,6 +183,7 @@ CXDChangeRecords ApplyLoop::accepted() {
 void ApplyLoop::queue() {
     CXDChangeRecords accepted = this->accepted();
     CXDLog("Mingled: %@", accepted);
+    putNewsOfGroupsLast(accepted);
     std::unordered_set<UniqueId> lossy;
     CXDChangeRecords flat = flattenGroupChanges(accepted, &lossy);
     for (const UniqueId& group : lossy) {
@@ -209,15 +210,12 @@ void ApplyLoop::split() {
     if (!now.empty()) noteUnderWay();
 }
 
-// What cannot be noted is done all the same: a full disk does not keep the store out of step.
+// What cannot be noted is not done: a later pass would find it on the store, take it for somebody else's, and bring it
+// back over what the owner has changed meanwhile.
 void ApplyLoop::noteUnderWay() {
-    try {
-        claimState();
-        _parts.state.setUnderWay(*_underWay);
-        _parts.with.preferences.synchronize(kDaemonDomain);
-    } catch (const CXException& e) {
-        CXLog("applyChangeRecords: Caught %@: %@", e.name(), e.reason());
-    }
+    claimState();
+    _parts.state.setUnderWay(*_underWay);
+    _parts.with.preferences.synchronize(kDaemonDomain);
 }
 
 void ApplyLoop::applyOutOfOrder() {

@@ -122,6 +122,13 @@ CXDChangeRecordPtr compositeFor(Part& part) {
 
 } // namespace
 
+void putNewsOfGroupsLast(CXDChangeRecords& records) {
+    std::stable_partition(records.begin(), records.end(), [](const CXDChangeRecordPtr& record) {
+        return !record->group() || record->initialSource() == CXDSyncSourceCX ||
+               record->appliesToSources() != CXDSyncSourceCX;
+    });
+}
+
 CXDChangeRecords flattenGroupChanges(const CXDChangeRecords& records, std::unordered_set<UniqueId>* lossy) {
     std::vector<Part> work = split(records);
     std::unordered_map<GroupOfUser, std::vector<uint32_t>, GroupOfUserHash> placesOfGroup; // ascending

@@ -9,6 +9,10 @@ namespace rolvane {
 // The group identifier that stands for all contacts; its changes are never folded.
 inline const UniqueId kPeopleGroup{"People"};
 
+// News of a group for the contact database goes behind what is written to that group's store: a fold takes in whatever
+// stands in front of it, and what it has taken in never reaches the database. The order is kept otherwise. O(C).
+void putNewsOfGroupsLast(CXDChangeRecords& records);
+
 // Splits group changes into one record a source and folds the changes of one user's group into one composite, which
 // takes the place of the group's last change. O(C) expected.
 //

@@ -1,7 +1,9 @@
 // Two people who write to one tree at the same time.
 
 #include "TwoUsers.h"
+#include "Writes.h"
 #include "engine/EngineState.h"
+#include "foundation/CXException.h"
 
 namespace rolvane::test {
 
@@ -275,6 +277,52 @@ TEST_F(TwoWriters, AContactThatWasDeletedLongAgoIsNamedByNoGroupIntoWhichAWriter
         for (Participant* each : {&alice, &bob}) each->pass();
     EXPECT_FALSE(stateOf(circle->uniqueId())["memberUIDState"].array().containsString(gone.str())) << log.text();
     EXPECT_EQ(copies(), alice.view()) << log.text();
+    for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
+}
+
+// The owner's daemon takes a name without a contact out of a group, and hears in the same pass who has joined it.
+TEST_F(TwoWriters, NewsOfAGroupArrivesThoughTheSamePassMendsTheGroupOnTheStore) {
+    const CXGroupRef circle = circleOfBoth();
+    const UniqueId gone = people[0]->uniqueId();
+    bob.application->removeRecord(bob.copyOf(people[0]));
+    copyOf(circle)->addMember(bob.copyOf(people[1]));
+    copyOf(circle)->setValue(Value("Bob's circle"), kCXGroupNameProperty);
+    bob.application->save();
+    bob.pass();
+    auto change =
+        std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, CXDAddRecordToGroup, kSelf, gone, circle->uniqueId());
+    change->setAppliesToSources(CXDSyncSourceVaultra);
+    alice.engine->applyChangeRecords({change}, true);
+    for (Participant* each : {&alice, &bob, &alice, &bob}) each->pass();
+    EXPECT_EQ(circle->memberUniqueIds(), std::vector<UniqueId>{people[1]->uniqueId()}) << log.text();
+    EXPECT_EQ(circle->name(), "Bob's circle");
+    EXPECT_EQ(copies(), alice.view());
+    for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
+}
+
+// A pass that could not be remembered would find its own writes on the store and take them for somebody else's.
+TEST_F(TwoWriters, WhatIsChangedAfterAPassOnAFullDiskIsNotTakenBackByWhatThatPassWrote) {
+    const CXGroupRef circle = circleOfBoth();
+    circle->setValue(Value("First name"), kCXGroupNameProperty);
+    alice.application->save();
+    alice.wire->clear();
+    alice.wire->intercept([](const HttpRequest& request) -> std::optional<HttpResponse> {
+        if (request.method == "PROPFIND") interceptWrites([] { return false; }); // no room from here on
+        return std::nullopt;
+    });
+    try {
+        alice.pass();
+    } catch (const CXException&) { // so it may end
+    }
+    interceptWrites(nullptr);
+    alice.wire->intercept({});
+    EXPECT_EQ(alice.writes(), 0u) << alice.wire->text();
+    alice.start();
+    circle->setValue(Value("Second name"), kCXGroupNameProperty);
+    alice.application->save();
+    for (Participant* each : {&alice, &bob, &alice, &bob}) each->pass();
+    EXPECT_EQ(circle->name(), "Second name") << log.text();
+    EXPECT_EQ(copies(), alice.view());
     for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
 }
 
