@@ -15,18 +15,19 @@
 #include <sys/mman.h>
 #include <sys/wait.h>
 #include <unistd.h>
+#include <vector>
 
 namespace rolvane::worlds {
 namespace {
 
-constexpr const char* kUsage = R"(usage: worlds [--seeds FIRST..LAST] [--jobs N] [--without WHAT,...] [--steps N]
+constexpr const char* kUsage = R"(usage: worlds [--seeds LIST] [--jobs N] [--without WHAT,...] [--steps N]
               [--keep DIRECTORY] [--keep-all]
 
 Each seed is a world: an owner, a writer and a reader, who edit while requests fail, daemons are killed, the store is
 away and disks are full. In the end everybody's copy, the store and a plain model must be equal. A line a world, then a
 table; exit status 1 when anything differs.
 
-  --seeds    which worlds (1..20)
+  --seeds    which worlds: numbers and ranges, as 1..20,33 (1..20)
   --jobs     how many at a time (1)
   --without  leaves out: kills, faults, outages, disks, refusals, nesting, writer, overlap,
              last: the last contact is never deleted, single kinds of faults: 500, 503, 412, 423, 403, 404, reset,
@@ -42,7 +43,7 @@ struct Totals {
 };
 
 struct Arguments {
-    uint64_t first = 1, last = 20;
+    std::vector<uint64_t> seeds;
     int jobs = 1;
     Options options;
 };
@@ -59,8 +60,21 @@ uint64_t numberOf(const std::string& text) {
     return number;
 }
 
+std::vector<uint64_t> seedsOf(const std::string& text) {
+    std::vector<uint64_t> seeds;
+    std::istringstream list(text);
+    for (std::string each; std::getline(list, each, ',');) {
+        const size_t dots = each.find("..");
+        const uint64_t first = numberOf(each.substr(0, dots));
+        const uint64_t last = dots == std::string::npos ? first : numberOf(each.substr(dots + 2));
+        for (uint64_t seed = first; seed <= last; ++seed) seeds.push_back(seed);
+    }
+    return seeds;
+}
+
 Arguments argumentsOf(int argc, char** argv) {
     Arguments a;
+    a.seeds = seedsOf("1..20");
     for (int i = 1; i < argc; ++i) {
         const std::string name = argv[i];
         if (name == "--help") {
@@ -74,9 +88,7 @@ Arguments argumentsOf(int argc, char** argv) {
         if (i + 1 == argc) misuse(name + " needs a value");
         const std::string value = argv[++i];
         if (name == "--seeds") {
-            const size_t dots = value.find("..");
-            a.first = numberOf(value.substr(0, dots));
-            a.last = dots == std::string::npos ? a.first : numberOf(value.substr(dots + 2));
+            a.seeds = seedsOf(value);
         } else if (name == "--jobs") {
             a.jobs = static_cast<int>(numberOf(value));
         } else if (name == "--steps") {
@@ -90,7 +102,7 @@ Arguments argumentsOf(int argc, char** argv) {
             misuse("there is no option " + name);
         }
     }
-    if (a.first > a.last || a.jobs < 1) misuse("there is nothing to do");
+    if (a.seeds.empty() || a.jobs < 1) misuse("there is nothing to do");
     return a;
 }
 
@@ -133,10 +145,10 @@ void work(const Arguments& arguments, Totals& totals) {
     options.ownsProcess = true;
     PrivateStore store(options);
     store.start();
-    for (uint64_t seed = 0; (seed = totals.next++) <= arguments.last;) {
+    for (uint64_t next = 0; (next = totals.next++) < arguments.seeds.size();) {
         Outcome outcome;
         {
-            World world(store, seed, arguments.options);
+            World world(store, arguments.seeds[next], arguments.options);
             outcome = world.run();
         }
         print(outcome);
@@ -148,7 +160,6 @@ int run(const Arguments& arguments) {
     void* shared = ::mmap(nullptr, sizeof(Totals), PROT_READ | PROT_WRITE, MAP_SHARED | MAP_ANONYMOUS, -1, 0);
     if (shared == MAP_FAILED) misuse("there is no memory");
     auto* totals = new (shared) Totals;
-    totals->next = arguments.first;
     bool failed = false;
     for (int job = 0; job < arguments.jobs; ++job)
         if (::fork() == 0) {
@@ -171,7 +182,7 @@ int run(const Arguments& arguments) {
                 t.edits.load(), t.conflicts.load(), t.passes.load(), t.kills.load(), t.faults.load(), t.away.load(),
                 t.diskFailures.load(), t.refusals.load(), t.exceptions.load(), t.threeRounds.load(),
                 t.worlds == 0 ? 0.0 : static_cast<double>(t.milliseconds) / 1000 / static_cast<double>(t.worlds));
-    failed |= t.worlds != arguments.last - arguments.first + 1;
+    failed |= t.worlds != arguments.seeds.size();
     return failed || t.differing > 0 ? 1 : 0;
 }
 
