@@ -56,6 +56,18 @@ CXDAVManager::Impl::Impl(CXDAVAccount account, std::shared_ptr<HttpTransport> tr
       files(session, tokens, versions), structure(session, files), accessLists(session),
       ownTree(treeOf(session.account())) {}
 
+StoreFiles::Reading CXDAVManager::Impl::read(const Url& name, bool securely) {
+    const auto endsATree = [](int code) { return code == 403 || code == 404; };
+    StoreFiles::Reading once = files.read(name, securely);
+    const Url tree = name.cxURLByDeletingLastComponent();
+    const bool isInfo = name.cxLastComponent() == "info" && tree.pathComponents().size() == 3; // "/", user, "Contacts"
+    if (!isInfo || !endsATree(once.code)) return once;
+    CXLog("%@ was answered with %d. It is asked once more.", name, once.code);
+    if (!session.provesItself()) return {};
+    if (tree.absoluteString() + "/" == ownTree) structure.check(true);
+    return files.read(name, securely);
+}
+
 StoreListing::AskedRef CXDAVManager::Impl::begun(const Url& container) {
     const std::lock_guard guard(begunLock);
     const auto found = begunListings.find(container.absoluteString());
@@ -175,7 +187,7 @@ std::optional<Date> CXDAVManager::modDateForURL(const Url& url) {
 }
 
 std::optional<Dictionary> CXDAVManager::dictionaryAtURL(const Url& url, bool securely, int* code) {
-    auto reading = _impl->files.read(url, securely);
+    auto reading = _impl->read(url, securely);
     setCode(code, reading.code);
     return std::move(reading.dictionary);
 }

@@ -34,8 +34,9 @@ inline constexpr int kCXDAVErrorNoAccount = -1100; // no account, or one that ca
 // it knows where the bytes are. Any thread; operations wait for the server, at most the transport's deadlines.
 //
 // Result codes are the server's own HTTP status; 0 when no answer came or the answer cannot be believed (whoever
-// answered is not a WebDAV server: a captive portal or a proxy). 403 and 404 come only from a server that answered
-// OPTIONS with "DAV: 1". A 207 to PUT, DELETE or MKCOL is a failure.
+// answered is not a WebDAV server: a captive portal or a proxy; see ExpectedAnswer). Refusals come only from a server
+// that answered OPTIONS with "DAV: 1". A 207 to PUT, DELETE or MKCOL is a failure. Of a tree's "info", 403 and 404 are
+// what the store has said twice.
 //
 // Conditional writes: when a thread reads the dictionary at a URL and its next operation on a dictionary is a write to
 // the same URL, the write goes through only if the file is still the one that was read (or still absent); otherwise

@@ -28,6 +28,11 @@ struct CXDAVManager::Impl {
     StoreAccessLists accessLists;
     const std::string ownTree; // what every name below the account's own tree begins with
 
+    // Reads a dictionary. That a tree's "info" is forbidden or absent, which ends a publication or a subscription, is
+    // told only when the store says it twice; in between it shows that it is a WebDAV server, and its owner's client
+    // looks after the tree's structure.
+    StoreFiles::Reading read(const Url& name, bool securely);
+
     std::mutex begunLock;
     std::map<std::string, StoreListing::AskedRef> begunListings; // by container; guarded by begunLock
     StoreListing::AskedRef begun(const Url& container);          // hands it out; null when there is none

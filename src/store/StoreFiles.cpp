@@ -144,7 +144,7 @@ StoreFiles::Fetched StoreFiles::fetch(const Url& url, bool mayBeCollection) {
     std::optional<HttpResponse> waiting = _early.take(url);
     if (!waiting) waiting = _ahead.take(url);
     const StoreSession::Handled handled = mayBeCollection ? mayMeanACollection : isAbsenceOrDenial;
-    HttpResponse answer = waiting ? _session.judged("GET", url, std::move(*waiting), handled)
+    HttpResponse answer = waiting ? _session.judged(StoreSession::request("GET", url), std::move(*waiting), handled)
                                   : _session.send(StoreSession::request("GET", url), handled);
     // httpd says 403 of a file that is replaced or removed while it is being opened, too: only what is said twice
     // counts.
@@ -216,7 +216,8 @@ StoreFiles::Fetched StoreFiles::fetchEither(const Url& url, Url& target) {
 StoreFiles::Fetched StoreFiles::confirmed(const Fetched& once, const Url& target) {
     Fetched again = fetch(target, false);
     const bool same = again.version.etag == once.version.etag && again.version.size == once.version.size;
-    if (again.found == Found::noDictionary && !same) again.found = Found::failed;
+    const bool isSure = same && _session.provesItself(); // a portal says the same to everything
+    if (again.found == Found::noDictionary && !isSure) again.found = Found::failed;
     return again;
 }
 

@@ -96,7 +96,8 @@ StoreListing::Members StoreListing::read(Asked& asked, size_t number) {
     Members out;
     const Url place = *_session.endpoint(asked.containers[number]);
     const HttpResponse answer =
-        _session.judged("PROPFIND", place, std::move(asked.answers[number]), [](int status) { return status == 404; });
+        _session.judged(StoreSession::request("PROPFIND", place), std::move(asked.answers[number]),
+                        [](int status) { return status == 404; });
     const auto staged = std::move(asked.staged[number]);
     out.code = answer.status;
     out.serverDate = serverDateOf(answer);

@@ -2,7 +2,10 @@
 
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "store/ExpectedAnswer.h"
+#include "store/Multistatus.h"
 
+#include <algorithm>
 #include <cstdlib>
 #include <utility>
 
@@ -39,6 +42,13 @@ const std::shared_ptr<const std::string>& propfindBody(bool withMembersTags) {
     static const auto plain = makePropfindBody("");
     static const auto tags = makePropfindBody("<members-tag xmlns=\"http://rolvane.net/ns/\"/>");
     return withMembersTags ? tags : plain;
+}
+
+const std::shared_ptr<const std::string>& lockdiscoveryBody() {
+    static const auto body =
+        std::make_shared<const std::string>("<?xml version=\"1.0\" encoding=\"utf-8\"?>\n<propfind "
+                                            "xmlns=\"DAV:\"><prop><lockdiscovery/></prop></propfind>");
+    return body;
 }
 
 // The answer to a request that has no password to go with.
@@ -133,25 +143,65 @@ bool StoreSession::signIn() {
     return true;
 }
 
-HttpResponse StoreSession::believed(HttpResponse answer) {
+HttpResponse StoreSession::believed(const HttpRequest& asked, HttpResponse answer) {
     if (answer.status == 401) {
         std::lock_guard guard(_mutex);
         _loginRefused = true;
         _loginProven = false;
     }
-    if ((answer.status == 403 || answer.status == 404) && !isDavServer()) {
-        HttpResponse unbelieved;
-        unbelieved.error = TransportError::unreachable;
-        unbelieved.detail = "Whoever answered is not a WebDAV server.";
-        return unbelieved;
+    bool isBelieved = true;
+    switch (verdictOn(asked.method, answer)) {
+    case AnswerVerdict::success:
+    case AnswerVerdict::failure: break;
+    case AnswerVerdict::graveRefusal: isBelieved = provesItself(); break;
+    case AnswerVerdict::refusal: isBelieved = isDavServer(); break;
+    case AnswerVerdict::needsProof: isBelieved = isProven(asked); break;
+    case AnswerVerdict::foreign: isBelieved = false; break;
     }
-    return answer;
+    if (isBelieved) return answer;
+    _davSeen = 0; // it may have been one until now
+    HttpResponse unbelieved;
+    unbelieved.error = TransportError::unreachable;
+    unbelieved.detail = "Whoever answered is not a WebDAV server, or did not do it: " + accountOf(asked.method, answer);
+    return unbelieved;
 }
 
-HttpResponse StoreSession::judged(std::string_view method, const Url& url, HttpResponse answer, Handled handled) {
-    HttpResponse heeded = believed(std::move(answer));
-    const bool succeeded = heeded.ok() || (heeded.status == 207 && method == "PROPFIND");
-    if (!succeeded && !(heeded.complete() && handled && handled(heeded.status))) noteFailure(method, url, heeded);
+// The server shows anew that it is a WebDAV server, and that it has done what it says.
+bool StoreSession::isProven(const HttpRequest& asked) {
+    return provesItself() && hasDone(asked);
+}
+
+bool StoreSession::hasDone(const HttpRequest& asked) {
+    const auto look = [&](HttpRequest looking) { return _transport->perform(std::move(looking)); };
+    if (asked.method == "PUT") {
+        const HttpResponse there = look(request("GET", asked.url));
+        return there.status == 200 && asked.body && there.body == *asked.body;
+    }
+    if (asked.method == "DELETE") return look(propfind(asked.url, 0)).status == 404;
+    if (asked.method == "MKCOL") {
+        const HttpResponse there = look(propfind(asked.url, 0));
+        MultistatusReader reader;
+        const auto entries = there.status == 207 && reader.feed(there.body) ? reader.finish() : std::nullopt;
+        return entries && entries->size() == 1 && entries->front().isCollection;
+    }
+    if (asked.method == "UNLOCK") {
+        HttpRequest looking = propfind(asked.url, 0);
+        looking.body = lockdiscoveryBody();
+        const HttpResponse there = look(std::move(looking));
+        const auto token = std::find_if(asked.headers.begin(), asked.headers.end(),
+                                        [](const auto& header) { return header.first == "Lock-Token"; });
+        if (there.status == 404) return true;
+        if (there.status != 207 || token == asked.headers.end() || token->second.size() < 3) return false;
+        return there.body.find(token->second.substr(1, token->second.size() - 2)) == std::string::npos;
+    }
+    return true; // it has only been asked for something
+}
+
+HttpResponse StoreSession::judged(const HttpRequest& asked, HttpResponse answer, Handled handled) {
+    HttpResponse heeded = believed(asked, std::move(answer));
+    const bool succeeded = heeded.ok() || (heeded.status == 207 && asked.method == "PROPFIND");
+    if (!succeeded && !(heeded.complete() && handled && handled(heeded.status)))
+        noteFailure(asked.method, asked.url, heeded);
     return heeded;
 }
 
@@ -160,22 +210,20 @@ void StoreSession::noteFailure(std::string_view method, const Url& url, const Ht
 }
 
 HttpResponse StoreSession::send(HttpRequest request, Handled handled) {
-    const std::string method = request.method;
-    const Url url = request.url;
-    return judged(method, url, signIn() ? _transport->perform(std::move(request)) : unsent(), handled);
+    const HttpRequest asked = request;
+    return judged(asked, signIn() ? _transport->perform(std::move(request)) : unsent(), handled);
 }
 
 HttpResponse StoreSession::sendUnnoted(HttpRequest request) {
-    return believed(signIn() ? _transport->perform(std::move(request)) : unsent());
+    const HttpRequest asked = request;
+    return believed(asked, signIn() ? _transport->perform(std::move(request)) : unsent());
 }
 
 std::vector<HttpResponse> StoreSession::sendAll(std::vector<HttpRequest> requests, Handled handled) {
-    std::vector<std::pair<std::string, Url>> asked;
-    for (const HttpRequest& request : requests) asked.emplace_back(request.method, request.url);
+    const std::vector<HttpRequest> asked = requests;
     auto answers =
         signIn() ? _transport->performAll(std::move(requests)) : std::vector<HttpResponse>(requests.size(), unsent());
-    for (size_t i = 0; i < answers.size(); ++i)
-        answers[i] = judged(asked[i].first, asked[i].second, std::move(answers[i]), handled);
+    for (size_t i = 0; i < answers.size(); ++i) answers[i] = judged(asked[i], std::move(answers[i]), handled);
     return answers;
 }
 
@@ -212,6 +260,12 @@ std::optional<bool> StoreSession::keepsAccessLists() {
     if (_accessLists < 0 && signIn()) options();
     const int kept = _accessLists;
     return kept < 0 ? std::nullopt : std::optional(kept == 1);
+}
+
+bool StoreSession::provesItself() {
+    if (!signIn()) return false;
+    options();
+    return _davSeen != 0;
 }
 
 bool StoreSession::isDavServer() {
@@ -261,7 +315,9 @@ bool StoreSession::canReach(CXDAVError& error, const std::function<void()>& mean
     const std::vector<HttpResponse> answers = optionsAndMore(std::move(proof));
     for (size_t i = 0; i < answers.size(); ++i) {
         const HttpResponse& answer = answers[i];
-        if (answer.complete() && answer.status != 401 && _davSeen != 0) continue;
+        // A refusal of the tree is no refusal of the login: whose tree it is nobody has said yet.
+        const bool isForeign = i > 0 && verdictOn("PROPFIND", answer) == AnswerVerdict::foreign;
+        if (answer.complete() && answer.status != 401 && !isForeign && _davSeen != 0) continue;
         const char* asked = i == 0 ? "OPTIONS" : "PROPFIND";
         error = errorFrom(answer, asked);
         noteFailure(asked, endpoint(_account.baseLocationFor(_account.user)).value_or(Url()), answer);

@@ -36,15 +36,19 @@ public:
     // Which statuses, besides success, the caller handles: those answers are no failures of its operation.
     using Handled = bool (*)(int status);
 
-    // Sends the request. A 403 or 404 is believed only from a WebDAV server: otherwise the answer is an `unreachable`.
-    // An answer that is neither success nor handled is noted among the failures.
+    // Sends the request. What no WebDAV server answers (see ExpectedAnswer) is an `unreachable`. A refusal is believed
+    // only of a server that has proven itself within half a minute, and a success that a portal gives, too, only when
+    // the server has proven itself anew and shows what it has done. An answer that is neither success nor handled is
+    // noted among the failures.
     HttpResponse send(HttpRequest request, Handled handled = nullptr);
     std::vector<HttpResponse> sendAll(std::vector<HttpRequest> requests, Handled handled = nullptr);
     // The same, and nothing is noted: whoever asks in more than one way notes the failure when all have failed.
     HttpResponse sendUnnoted(HttpRequest request);
     // Sends it and calls back with the answer as it came; whoever uses that has it judged then, on its own thread.
     void start(HttpRequest request, HttpTransport::Completion done);
-    HttpResponse judged(std::string_view method, const Url& url, HttpResponse answer, Handled handled = nullptr);
+    HttpResponse judged(const HttpRequest& asked, HttpResponse answer, Handled handled = nullptr);
+    // Asks the server now whether it is a WebDAV server.
+    bool provesItself();
     // An answer that was handled, and still made the caller's operation fail.
     void noteFailure(std::string_view method, const Url& url, const HttpResponse& answer);
     RequestFailures& failures() { return _failures; }
@@ -71,7 +75,9 @@ public:
 private:
     bool signIn();
     bool isDavServer();
-    HttpResponse believed(HttpResponse answer);
+    HttpResponse believed(const HttpRequest& asked, HttpResponse answer);
+    bool isProven(const HttpRequest& asked);
+    bool hasDone(const HttpRequest& asked);
     HttpResponse options();
     std::vector<HttpResponse> optionsAndMore(std::vector<HttpRequest> requests);
     CXDAVError errorFrom(const HttpResponse& answer, const char* asked) const;

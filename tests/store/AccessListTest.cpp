@@ -174,7 +174,8 @@ TEST(Query, FailsOnceForAnythingElseThanTheDepth) {
         CXDAVQuery query(*store.manager, store.base);
         EXPECT_FALSE(query.execute()) << status;
         EXPECT_FALSE(query.succeeded());
-        EXPECT_EQ(query.status(), status);
+        EXPECT_EQ(query.status(), status == 200 ? 0 : status)
+            << "a success of that kind is nobody's who knows the question";
         EXPECT_EQ(store.wire->count("PROPFIND"), 1u) << status;
     }
 }
