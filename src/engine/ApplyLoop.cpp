@@ -10,6 +10,7 @@
 #include "engine/Mingler.h"
 #include "engine/OutOfOrderWork.h"
 #include "engine/PublicationCache.h"
+#include "engine/RecordIdentity.h"
 #include "engine/RefusedChanges.h"
 #include "engine/UnderWay.h"
 #include "engine/UnsettledGroups.h"
@@ -35,6 +36,10 @@ CXDChangeRecords mingled(const CXDChangeRecords& input) {
     Mingler mingler;
     mingler.mingle(input);
     return mingler.takeMingled();
+}
+
+bool waitsForTheFolderAlone(const CXDChangeRecord& record) {
+    return record.appliesToSources() == CXDSyncSourceLocal;
 }
 
 // Without what waits for other trees, which have groups of the same names, and for sources that no pass writes to.
@@ -148,6 +153,7 @@ void ApplyLoop::applyAll(bool trickle) {
     const size_t fresh = _unhandled.size();
     append(_unhandled, _parts.state.getPendingChanges());
     _queueTaken = true;
+    setAside(fresh);
     _underWay = _parts.state.underWay(); // of a pass that was killed, or what an earlier one left adrift
     _unsettled = unsettledGroups(_unhandled, fresh);
     for (const auto& [group, isSo] : unsettledOwnGroups(_unhandled, fresh)) noteUnsure(UniqueId(group));
@@ -161,6 +167,23 @@ void ApplyLoop::applyAll(bool trickle) {
     split();
     applyOutOfOrder();
     applyInOrder();
+}
+
+// What waits for the shared folder alone is applied by no pass, and says nothing about what the store holds: news of
+// the same contact would be taken for contradicted, or left for later, for as long as it waits.
+void ApplyLoop::setAside(size_t fresh) {
+    const auto queue = _unhandled.begin() + static_cast<std::ptrdiff_t>(fresh);
+    const auto first = std::stable_partition(
+        queue, _unhandled.end(), [](const CXDChangeRecordPtr& record) { return !waitsForTheFolderAlone(*record); });
+    _setAside.assign(first, _unhandled.end());
+    _unhandled.erase(first, _unhandled.end());
+    if (_setAside.empty()) return;
+    const std::unordered_set<CXDChangeRecordPtr, RecordHash, RecordEqual> again(_unhandled.begin(), _unhandled.end());
+    std::erase_if(_setAside, [&](const CXDChangeRecordPtr& record) { return again.contains(record); });
+    withdrawWhatIsGone(_setAside, 0, _parts.with.rolvane);
+    dropRemovalsOfWhatIsBack(_setAside, 0, _parts.with.rolvane);
+    _setAside = flattenGroupChanges(mingled(_setAside));
+    for (const CXDChangeRecordPtr& record : _setAside) record->packPayload();
 }
 
 // What the contact database swallows changes nothing, so it contradicts nothing: the owner's own change would be given
@@ -252,7 +275,8 @@ bool ApplyLoop::meetsOwnWaitingWrite(const CXDChangeRecord& record) {
     if (!_waitingWrites) {
         _waitingWrites.emplace();
         for (const CXDChangeRecordPtr& waiting : _outOfOrder->pending())
-            if (waiting->type() == CXDUpdateRecord && waiting->initialSource() == CXDSyncSourceCX && waiting->person())
+            if (waiting->type() == CXDUpdateRecord && waiting->initialSource() == CXDSyncSourceCX &&
+                waiting->person() && (waiting->appliesToSources() & CXDSyncSourceVaultra))
                 _waitingWrites->emplace(waiting->user().value_or(UserName()), cxNormalizedUID(*waiting->person()));
         for (const std::string& person : _parts.state.conduitObjectForKey(kConduitCX, kUnsettledPeople).allKeys())
             _waitingWrites->emplace(kSelf, UniqueId(person)); // refused, and to be sent again
@@ -399,6 +423,7 @@ void ApplyLoop::carryOver() {
     _inOrder.clear();
     append(_pendingChanges, std::move(_unhandled));
     _unhandled.clear();
+    append(_pendingChanges, std::exchange(_setAside, {}));
 }
 
 void ApplyLoop::storeAndClose(bool allowRetry) {
@@ -428,7 +453,10 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
     _queueStored = true;
     _end.unsureGroups.merge(groupsOf(ownWrites(_pendingChanges)));
     _end.everythingIsPublished = isPublished(*rolvane.allGroup());
-    const bool lookAgain = noteUnsettled() && _pendingChanges.empty();
+    const bool nothingWaits =
+        std::all_of(_pendingChanges.begin(), _pendingChanges.end(),
+                    [](const CXDChangeRecordPtr& record) { return waitsForTheFolderAlone(*record); });
+    const bool lookAgain = noteUnsettled() && nothingWaits;
     _pendingChanges.clear();
     tellRefused();
     if (!_parts.denied.empty() || lookAgain) {

@@ -39,7 +39,8 @@ public:
 
 private:
     void applyAll(bool trickle);
-    void queue(); // _unhandled becomes the flat list
+    void setAside(size_t fresh); // of the queue, which begins there
+    void queue();                // _unhandled becomes the flat list
     CXDChangeRecords accepted();
     bool noteSwallowed(const CXDChangeRecord& record);
     void tryAgainAtTheEnd(int32_t source, const CXDChangeRecordPtr& record);
@@ -67,6 +68,7 @@ private:
     EngineParts& _parts;
     Actions _actions;
     CXDChangeRecords _unhandled; // what an exception would leave behind: the input, then the flat list
+    CXDChangeRecords _setAside;  // of the queue: what no pass applies
     bool _queueTaken = false;    // the stored queue is part of the pass
     bool _queueStored = false;
     CXDChangeRecords _pendingChanges;

@@ -40,7 +40,8 @@ std::pair<UserName, UniqueId> shared(const CXDChangeRecord& record, const Unique
 
 TakenOut::TakenOut(const CXDChangeRecords& records) {
     for (const CXDChangeRecordPtr& record : records)
-        if (const auto& uid = takenOutBy(*record)) _sources[shared(*record, *uid)] |= record->initialSource();
+        if (const auto& uid = takenOutBy(*record); uid && record->appliesToSources() != CXDSyncSourceLocal)
+            _sources[shared(*record, *uid)] |= record->initialSource();
 }
 
 bool TakenOut::isTakenOutByOthers(const CXDChangeRecord& record, const std::optional<UniqueId>& uid) const {

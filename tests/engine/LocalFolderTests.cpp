@@ -52,6 +52,36 @@ TEST_F(SharedFolder, APassLeavesItsRecordsPendingAndWritesNothingThere) {
     EXPECT_EQ(world.engine->conduitForSyncSource(CXDSyncSourceLocal), nullptr);
 }
 
+// Nothing would ever end the waiting.
+TEST_F(SharedFolder, WhatWaitsForItHoldsNothingBackThatComesFromTheStore) {
+    const auto fromStore = [](CXDChangeType type, const char* person, const char* group) {
+        return makeRecord(type, person, group, {CXDSyncSourceVaultra, CXDSyncSourceCX, "<self>"},
+                          type == CXDUpdateRecord ? Value(Dictionary{{"First", "theirs"}}) : Value());
+    };
+    const auto ours = [](CXDChangeType type, const char* person, const char* group, int32_t sources) {
+        return makeRecord(type, person, group, {CXDSyncSourceCX, sources, "<self>"},
+                          type == CXDUpdateRecord ? Value(Dictionary{{"First", "ours"}}) : Value());
+    };
+    // P1 and P2 have been written to the store, and P3 and G1 are gone from it.
+    world.engine->applyChangeRecords(
+        {ours(CXDUpdateRecord, "P1:CXPerson", nullptr, 6), ours(CXDUpdateRecord, "P2:CXPerson", nullptr, 2),
+         ours(CXDDeleteRecord, "P3:CXPerson", nullptr, 6), ours(CXDDeleteGroup, nullptr, "G1:CXGroup", 6)});
+    const Strings waiting = world.pending();
+    ASSERT_EQ(waiting.size(), 4u);
+    for (int pass = 0; pass < 2; ++pass) {
+        const CXDChangeRecords news{fromStore(CXDUpdateRecord, "P1:CXPerson", nullptr),
+                                    fromStore(CXDUpdateRecord, "P2:CXPerson", nullptr),
+                                    fromStore(CXDUpdateRecord, "P3:CXPerson", nullptr),
+                                    fromStore(CXDAddRecordToGroup, "P3:CXPerson", "G1:CXGroup")};
+        std::multiset<std::string> expected = world.cx->appliedWithTypes();
+        for (const CXDChangeRecordPtr& record : news)
+            expected.insert(record->person()->str() + " " + std::to_string(record->type()));
+        world.engine->applyChangeRecords(news);
+        EXPECT_EQ(world.cx->appliedWithTypes(), expected);
+        EXPECT_EQ(world.pending().size(), waiting.size());
+    }
+}
+
 // The conduit itself is whole: whoever hands it the pending records has them done.
 TEST_F(SharedFolder, WhatStaysPendingCanBeAppliedByTheConduit) {
     world.engine->applyChangeRecords({update("P1", 2)});
