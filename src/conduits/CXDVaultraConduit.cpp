@@ -275,7 +275,7 @@ bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state)
     if (!isOwn) return false;
     const bool isRefused = !engine().conduitObjectForKey(kConduitCX, kRefusedByStore).empty();
     if (condition.kind == TreeCondition::Kind::lostAGroup && isRefused) return false; // it could not be written yet
-    if (condition.kind == TreeCondition::Kind::lostAGroup && !looked)
+    if (condition.mayPass() && !looked)
         prior.set(kLookAgain, true);
     else
         publishAgain();
@@ -479,8 +479,13 @@ bool CXDVaultraConduit::makeCompositeGroupChange(CXDChangeRecord& record, int& c
     if (!base || !record.group()) return false;
     const Url location = layout::groupLocation(*base, *record.group());
     auto state = _world.manager.dictionaryAtURL(location, false, &code);
-    if (!state && code == kMissing && wasDeletedThere(record)) return true;
-    if (!state && code == kOk) state = lastKnownState(record);
+    if (!state && code == kMissing) {
+        const bool isList = record.group()->str() == layout::kAllGroup;
+        if (isList && !record.changeMadeByDataOwner()) return false; // it waits for its owner's
+        if (wasDeletedThere(record)) return true;
+    }
+    // A part alone would be taken for all of it.
+    if (!state && (code == kMissing || code == kOk)) state = lastKnownState(record);
     const Dictionary changed = layout::groupStateAfterComposite(state.value_or(Dictionary()), contentOf(record));
     // A state that is there and could not be read is not replaced by a part of it: the client then sends no write, and
     // the answer to the read stands.
@@ -506,11 +511,13 @@ bool CXDVaultraConduit::wasDeletedThere(CXDChangeRecord& record) {
     return true;
 }
 
-// In the place of a state file that has come to harm: what it held when it was seen last, as far as such a file says
-// it.
+// In the place of a state file that is lost or has come to harm: what it held when it was seen last, as far as such a
+// file says it. Of a list of everybody that was never seen, what the owner's database is known to publish.
 Dictionary CXDVaultraConduit::lastKnownState(const CXDChangeRecord& record) {
     if (!record.user() || !record.group()) return {};
-    const Dictionary known = engine().knownGroupState(kConduitVaultra, *record.user(), *record.group());
+    Dictionary known = engine().knownGroupState(kConduitVaultra, *record.user(), *record.group());
+    if (known.empty() && record.changeMadeByDataOwner() && record.group()->str() == layout::kAllGroup)
+        known = engine().knownGroupState(kConduitCX, *record.user(), *record.group());
     Dictionary state;
     for (const char* key : {kMemberUIDState, kSubgroupUIDState, kCXGroupNameProperty, kDistributionListState})
         if (const Value& part = known[key]) state.set(key, part);

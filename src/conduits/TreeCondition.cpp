@@ -52,6 +52,17 @@ bool isSetBack(const Dictionary& prior, const Dictionary& current, const std::op
     return made && madeBefore && *made != *madeBefore;
 }
 
+// A change of the list that met no list, and was written as if it were all of it. Who is deleted leaves the list and
+// the tree; here nobody whom the list named before is in it, and every one of them lies there.
+bool isListReplaced(const Array& before, const Array& now, const Dictionary& people) {
+    if (now.empty() || before.count() < 2 || people.count() < before.count()) return false;
+    std::unordered_set<std::string> named;
+    for (const Value& name : now) named.insert(name.string());
+    return std::all_of(before.begin(), before.end(), [&](const Value& name) {
+        return !named.contains(name.string()) && people.contains(name.string());
+    });
+}
+
 CXDChangeRecordPtr ownersChange(CXDChangeType type, std::optional<UniqueId> person, std::optional<UniqueId> group,
                                 const Value& payload = {}) {
     auto record =
@@ -65,11 +76,14 @@ CXDChangeRecordPtr ownersChange(CXDChangeType type, std::optional<UniqueId> pers
 TreeCondition treeCondition(const Dictionary& prior, const Dictionary& current, std::optional<Date> lastVisit) {
     if (isSetBack(prior, current, lastVisit)) return {Kind::setBack, "is a copy from another time"};
     if (prior[kEverybody].dictionary()[kMemberUIDState].array().empty()) return {};
-    const bool hasContacts = !current[kPeopleState].dictionary()[kMemberUIDState].dictionary().empty();
+    const Dictionary people = current[kPeopleState].dictionary()[kMemberUIDState].dictionary();
+    const bool hasContacts = !people.empty();
     const Value& everybody = current[kEverybody];
     const Array* listed = everybody.dictionary()[kMemberUIDState].arrayIf();
     if (!listed && (everybody || !hasContacts || lastVisit))
         return {Kind::lostLists, "has lost the list of its contacts"};
+    if (listed && isListReplaced(prior[kEverybody].dictionary()[kMemberUIDState].array(), *listed, people))
+        return {Kind::replacedList, "has another list, which names nobody of those who lie there"};
     if (hasLostAGroup(prior, current)) return {Kind::lostAGroup, "has lost a group that it still names"};
     const bool isEmptied = listed && listed->empty();
     if (!hasContacts && !isEmptied) return {Kind::lostContacts, "has lost the contents of its contacts"};

@@ -30,12 +30,15 @@ struct TreeCondition {
         sound,
         setBack,      // an older copy, or a copy whose files have got new dates
         lostLists,    // there were contacts, and what said so is gone
+        replacedList, // another list stands there, and all whom it does not name any longer still lie there
         lostAGroup,   // one that the tree's own lists still name; for a moment so while somebody deletes it
         lostContacts, // there were contacts, their list names some, and there is not one file of one
     };
     Kind kind = Kind::sound;
     std::string sentence; // what is wrong, for a log; empty when nothing is
     bool isSound() const { return kind == Kind::sound; }
+    // For a moment it also looks so while somebody who may write is at it.
+    bool mayPass() const { return kind == Kind::replacedList || kind == Kind::lostAGroup; }
 };
 
 // `prior` is the state that the last pass left, `current` what the store says now, both of one tree (one serial

@@ -341,8 +341,10 @@ bool ApplyLoop::applyTo(CXDConduit& conduit, int32_t source, const CXDChangeReco
         return false;
     }
     if (isGivenUp(_parts, *record)) return true;
-    const bool ofOwnGroup = conduit.swallows(*record) && noteSwallowed(*record);
+    const bool swallowed = conduit.swallows(*record);
+    const bool ofOwnGroup = swallowed && noteSwallowed(*record);
     // Done with, but not remembered: the next comparison offers it again.
+    if (swallowed && !ofOwnGroup && isOfAStrangeGroup(*record)) return true;
     if (!ofOwnGroup && !conduit.holds(*record)) {
         if (conduit.waitsForWhatFollows(*record)) tryAgainAtTheEnd(source, record);
         return true;
@@ -388,6 +390,12 @@ bool ApplyLoop::noteSwallowed(const CXDChangeRecord& record) {
     _unsettled.set(record.group()->str(), true);
     noteUnsure(*record.group());
     return true;
+}
+
+// One that the database does not have. It comes when somebody may write, unless it is taken for known before.
+bool ApplyLoop::isOfAStrangeGroup(const CXDChangeRecord& record) const {
+    return record.group() && record.group()->str() != kCXAllGroupUID && record.type() != CXDDeleteGroup &&
+           !_parts.with.rolvane.recordForUniqueId(cxUIDWithTableName(*record.group(), kCXGroupTable));
 }
 
 // The list stays the same for the whole pass, so one walk a user is enough.

@@ -43,6 +43,7 @@ private:
     void queue();                // _unhandled becomes the flat list
     CXDChangeRecords accepted();
     bool noteSwallowed(const CXDChangeRecord& record);
+    bool isOfAStrangeGroup(const CXDChangeRecord& record) const;
     void tryAgainAtTheEnd(int32_t source, const CXDChangeRecordPtr& record);
     void split();
     void noteUnderWay();

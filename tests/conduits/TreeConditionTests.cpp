@@ -98,6 +98,24 @@ TEST(TreeCondition, AListThatIsThereAndNamesNobodyAtAllIsALossAndAnEmptyOneIsNot
     EXPECT_EQ(kindOf(tree(), current), Kind::lostAGroup) << "which is listed";
 }
 
+TEST(TreeCondition, AnotherListIsALossWhereAllWhomItNamedBeforeStillLieThere) {
+    const auto naming = [](const Array& members) {
+        Dictionary state = tree();
+        state.set("AllCXGroup", Dictionary{{kMemberUIDState, members}});
+        return state;
+    };
+    EXPECT_EQ(kindOf(tree(), naming({"c:CXPerson"})), Kind::replacedList);
+    EXPECT_EQ(kindOf(tree(), naming({"a:CXPerson", "c:CXPerson"})), Kind::sound) << "somebody left";
+    EXPECT_EQ(kindOf(tree(), naming({})), Kind::sound) << "an emptied list";
+    Dictionary deleted = naming({"c:CXPerson"});
+    deleted.set(kPeopleState,
+                Dictionary{{kMemberUIDState, Dictionary{{"a:CXPerson", Dictionary()}, {"c:CXPerson", Dictionary()}}}});
+    EXPECT_EQ(kindOf(tree(), deleted), Kind::sound) << "they are being deleted";
+    Dictionary one = tree();
+    one.set("AllCXGroup", Dictionary{{kMemberUIDState, Array{"a:CXPerson"}}});
+    EXPECT_EQ(kindOf(one, naming({"c:CXPerson"})), Kind::sound) << "of one contact nobody can tell";
+}
+
 TEST(TreeCondition, AGroupThatIsGoneAndStillNamedIsALossAndADeletedOneIsNot) {
     Dictionary current = without(tree(), "G:CXGroup");
     EXPECT_EQ(kindOf(tree(), current), Kind::lostAGroup);

@@ -80,4 +80,31 @@ TEST_F(BogusChanges, WhatTheDatabaseDoesNotHaveIsLeftWhereItIs) {
     EXPECT_EQ(alice.application->recordForUniqueId(strange->uniqueId()), nullptr);
 }
 
+TEST_F(BogusChanges, AGroupThatWasLeftWhereItIsComesWhenSomebodyMayWrite) {
+    const CXGroupRef strange = CXGroup::create();
+    const std::string name = strange->uniqueId().str();
+    rewrite(world->file(name), PropertyList::toXML(Dictionary{{kCXGroupNameProperty, "Strange"},
+                                                              {kMemberUIDState, Array{people[0]->uniqueId().str()}}}));
+    const std::filesystem::path list = world->file(std::string(kCXAllGroupUID));
+    const std::filesystem::path file = std::filesystem::is_directory(list) ? list / CXDAVManager::kStateName : list;
+    Dictionary everybody = contentOf(file).mutableCopy();
+    Array groups = everybody[kSubgroupUIDState].array().mutableCopy();
+    groups.append(name);
+    everybody.set(kSubgroupUIDState, groups);
+    rewrite(file, PropertyList::toXML(everybody));
+    settle();
+    ASSERT_EQ(alice.application->recordForUniqueId(strange->uniqueId()), nullptr);
+    CXMutableMultiValue writers;
+    writers.addValue("bob", "bob");
+    for (const char* each : {kCXReadSharingACLProperty, kCXReadWriteSharingACLProperty})
+        alice.application->allGroup()->setValue(writers, each);
+    alice.application->save();
+    alice.start();
+    settle();
+    const auto come = std::dynamic_pointer_cast<CXGroup>(alice.application->recordForUniqueId(strange->uniqueId()));
+    ASSERT_TRUE(come) << log.text();
+    EXPECT_EQ(come->name(), "Strange");
+    EXPECT_EQ(come->memberUniqueIds(), std::vector{people[0]->uniqueId()});
+}
+
 } // namespace rolvane::test

@@ -60,7 +60,9 @@ TEST_F(LocksOfPasses, AnEditGoesOutInTheNextPassWhenTheStoreWentAwayBehindTheLoc
     const auto wire = world->transport("alice");
     std::atomic<bool> isAway{false};
     alice.wire->intercept([&](const HttpRequest& request) {
-        if (request.method == "LOCK" && !isAway.exchange(true)) EXPECT_TRUE(wire->perform(request).ok());
+        if (request.method == "LOCK" && !isAway.exchange(true)) {
+            EXPECT_TRUE(wire->perform(request).ok());
+        }
         return isAway ? std::optional(lost()) : std::nullopt;
     });
     rename(alice, people[0], "Adelheid");

@@ -1,6 +1,7 @@
 // Stores that lose a part of what they held, or all of it, or what was written since some backup.
 
 #include "TwoUsers.h"
+#include "model/PayloadKeys.h"
 #include "support/WaitUntil.h"
 
 #include <ctime>
@@ -128,6 +129,86 @@ protected:
     TempDirectory place;
     const std::filesystem::path backup = place / "backup";
 };
+
+// -- a change of a list that meets no list
+
+class LostLists : public StoreLoss {
+protected:
+    std::filesystem::path stateOf(const std::string& name) {
+        const std::filesystem::path file = world->file(name);
+        return std::filesystem::is_directory(file) ? file / CXDAVManager::kStateName : file;
+    }
+    std::filesystem::path list() { return stateOf(std::string(kCXAllGroupUID)); }
+    // The change reaches the store in a pass that does not look at the tree.
+    static void send(Participant& whose) {
+        whose.wire->clear();
+        EXPECT_TRUE(whose.database->deliverExternalChanges());
+        EXPECT_GT(whose.wire->count("PUT"), 0u) << whose.wire->text();
+    }
+    static std::set<std::string> membersIn(const std::filesystem::path& file) {
+        std::set<std::string> members;
+        for (const Value& member : contentOf(file)[kMemberUIDState].array()) members.insert(member.string());
+        return members;
+    }
+};
+
+TEST_F(LostLists, TheOwnersChangeOfTheListIsWrittenWithTheWholeList) {
+    nobodyMayWrite();
+    settle();
+    std::filesystem::remove(list());
+    people.push_back(alice.add("Dora"));
+    send(alice);
+    ASSERT_TRUE(std::filesystem::exists(list())) << alice.wire->text();
+    EXPECT_EQ(membersIn(list()).size(), 4u) << textOf(list());
+    EXPECT_EQ(contentOf(list())[kSubgroupUIDState].array().count(), 1u) << textOf(list());
+    settle();
+    EXPECT_EQ(copies(), alice.view()) << log.text();
+    EXPECT_EQ(alice.countPeople(), 4u);
+}
+
+TEST_F(LostLists, TheOwnersChangeOfAGroupIsWrittenWithTheWholeGroup) {
+    nobodyMayWrite();
+    settle();
+    const std::filesystem::path state = stateOf(friends->uniqueId().str());
+    std::filesystem::remove(state);
+    friends->addMember(people[1]);
+    alice.application->save();
+    send(alice);
+    ASSERT_TRUE(std::filesystem::exists(state)) << alice.wire->text();
+    EXPECT_EQ(membersIn(state).size(), 3u) << textOf(state);
+    EXPECT_EQ(contentOf(state)[kCXGroupNameProperty], Value("Friends"));
+    settle();
+    EXPECT_EQ(copies(), alice.view()) << log.text();
+}
+
+TEST_F(LostLists, AWritersChangeOfTheListWaitsForTheOwners) {
+    settle();
+    ASSERT_EQ(copies(), alice.view());
+    std::filesystem::remove(list());
+    bob.application->removeRecord(bob.copyOf(people[1]));
+    bob.application->save();
+    EXPECT_TRUE(bob.database->deliverExternalChanges());
+    EXPECT_FALSE(std::filesystem::exists(list())) << "a writer makes no list\n" << bob.wire->text();
+    EXPECT_FALSE(bob.engine->getPendingChanges().empty());
+    settle();
+    settle();
+    EXPECT_GE(alice.countPeople(), 2u) << log.text();
+    EXPECT_EQ(copies(), alice.view()) << log.text();
+    EXPECT_TRUE(bob.engine->getPendingChanges().empty());
+}
+
+// Another program, or an older one of somebody's, has written it so.
+TEST_F(LostLists, AListThatHoldsOneChangeAloneTakesNobodyOutOfAnyDatabase) {
+    settle();
+    const auto before = alice.view();
+    rewrite(list(), PropertyList::toXML(Dictionary{{kMemberUIDState, Array{CXPerson::create()->uniqueId().str()}}}));
+    bob.pass();
+    EXPECT_EQ(copies(), before) << log.text();
+    settle();
+    settle();
+    expectNothingLost(before);
+    EXPECT_GE(membersIn(list()).size(), 3u) << textOf(list());
+}
 
 // -- a store that was restored from an older copy
 
