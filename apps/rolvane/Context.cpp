@@ -2,7 +2,9 @@
 
 #include "Examples.h"
 
+#include "contacts/DamagedDatabase.h"
 #include "daemon/InstanceLock.h"
+#include "foundation/Preferences.h"
 
 #include <cmath>
 #include <fmt/format.h>
@@ -40,6 +42,7 @@ CXRolvane& Context::database() {
         CXRolvane::Options options;
         options.program = "rolvane";
         options.distributed = &bus();
+        requireKnownDatabase(options.path, Preferences::shared());
         CXRolvane::configureShared(options);
         _impl->opened = true;
     }

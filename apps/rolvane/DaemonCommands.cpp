@@ -9,6 +9,7 @@
 #include "Withdrawn.h"
 
 #include "daemon/DaemonControl.h"
+#include "engine/DatabaseCare.h"
 #include "engine/EngineState.h"
 #include "engine/PassOutcome.h"
 #include "store/CXDAVManager.h"
@@ -50,6 +51,10 @@ void daemonStatus(Context& context) {
 
 Json dateOrNull(const Value& value) {
     return value.date() ? Json(value.date()->toISO8601()) : Json();
+}
+
+Json textOrNull(const Value& value) {
+    return value.isString() ? Json(value.string()) : Json();
 }
 
 Json storeStatus() {
@@ -153,6 +158,7 @@ Json status(Context& context) {
     const bool shares = publication.anything() || !subscriptions.empty();
     return {{"people", database.countPeople(RemoteLocation(""))},
             {"groups", database.listGroups(RemoteLocation("")).size()},
+            {"damaged", textOrNull(preferences.get(kDaemonDomain, kCXDDamagedDatabase))},
             {"daemon", pid ? Json(*pid) : Json()},
             {"store", storeStatus()},
             {"published", {{"everything", publication.everything()}, {"groups", groups}}},
@@ -198,12 +204,14 @@ std::string inStepText(const Json& tree) {
 
 void showStatus(Context& context) {
     const Json s = status(context);
+    if (!s["damaged"].is_null()) context.exitCode = kFailed;
     if (context.json) return context.print(s);
     const auto row = [&](const std::string& label, const std::string& text) {
         context.line(fmt::format("{:<15}{}", label, text));
     };
     const size_t people = s["people"], groups = s["groups"], pending = s["pending"];
     row("Contacts", counted(people, "person", "people") + ", " + counted(groups, "group", "groups"));
+    if (!s["damaged"].is_null()) row("Database", s["damaged"].get<std::string>());
     row("Daemon", s["daemon"].is_null() ? "not running (`rolvane daemon start`)"
                                         : fmt::format("running, process {}", s["daemon"].get<int>()));
     if (s["store"].is_null()) {

@@ -8,6 +8,7 @@ namespace {
 
 const std::map<std::string, const char*>& examples() {
     static const std::map<std::string, const char*> all{
+        {"new-database", "  rolvane new-database && rolvane import backup.vcf"},
         {"import", "  rolvane import friends.vcf work.vcf\n"
                    "  curl https://example.org/team.vcf | rolvane import -"},
         {"export", "  rolvane export -o everybody.vcf\n"

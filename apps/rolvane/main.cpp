@@ -85,6 +85,7 @@ int main(int argc, char** argv) {
     addDaemonCommands(app, context);
     addPreferencesCommands(app, context);
     addStoreCommands(app, context);
+    addDatabaseCommands(app, context);
 
     try {
         app.parse(argc, argv);

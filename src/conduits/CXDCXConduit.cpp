@@ -7,6 +7,7 @@
 #include "conduits/RemovalChanges.h"
 #include "contacts/CXRolvane.h"
 #include "contacts/Constants.h"
+#include "contacts/DamagedDatabase.h"
 #include "contacts/Identifier.h"
 #include "foundation/Preferences.h"
 #include "model/PayloadKeys.h"
@@ -146,6 +147,7 @@ bool CXDCXConduit::saysSomething(const CXSubscription& subscription) const {
 void CXDCXConduit::addUnsettledGroups(ChangeCapture& capture) {
     const Dictionary unsettled = engine().conduitObjectForKey(kConduitCX, kUnsettledGroups);
     engine().setConduitObjectForKey(kConduitCX, Dictionary(), kUnsettledGroups);
+    AbsenceCheck absences(rolvane());
     for (const auto& [identifier, isSo] : unsettled) {
         bool isThere = identifier == kCXAllGroupUID;
         for (const std::string_view table : {kCXGroupTable, kCXSubscribedGroupTable}) {
@@ -155,7 +157,10 @@ void CXDCXConduit::addUnsettledGroups(ChangeCapture& capture) {
                 isThere = true;
             }
         }
-        if (!isThere) capture.add(changesToRemoveGroup(cxUIDWithTableName(UniqueId(identifier), kCXGroupTable)));
+        if (isThere) continue;
+        for (const std::string_view table : {kCXGroupTable, kCXSubscribedGroupTable})
+            absences.requireGone(cxUIDWithTableName(UniqueId(identifier), table));
+        capture.add(changesToRemoveGroup(cxUIDWithTableName(UniqueId(identifier), kCXGroupTable)));
     }
 }
 
@@ -186,11 +191,16 @@ void CXDCXConduit::rolvaneChanged(const Notification& notification) {
     const Array inserted = notification.userInfo[kCXInsertedRecords].array();
     const Array updated = notification.userInfo[kCXUpdatedRecords].array();
     ChangeCapture capture = newCapture();
-    if (inserted.count() + updated.count() >= kMany) capture.reader().expectMany();
-    captureInserted(capture, inserted);
-    captureReplaced(capture, inserted);
-    captureUpdated(capture, updated);
-    captureDeleted(capture, notification.userInfo[kCXDeletedRecords].array());
+    try {
+        if (inserted.count() + updated.count() >= kMany) capture.reader().expectMany();
+        captureInserted(capture, inserted);
+        captureReplaced(capture, inserted);
+        captureUpdated(capture, updated);
+        captureDeleted(capture, notification.userInfo[kCXDeletedRecords].array());
+    } catch (const CXDamagedDatabase&) {
+        engine().bringSourcesUpToDate(); // which repairs it; what was to be told here stays in the journal
+        throw;
+    }
 
     const CXDChangeRecords records = capture.take();
     if (records.empty())

@@ -30,7 +30,8 @@ UniqueId sharedGroup(const UniqueId& uid) {
 } // namespace
 
 ChangeCapture::ChangeCapture(ConduitEngine& engine, CXRolvane& rolvane, Dictionary priorState, std::string ownProgram)
-    : _engine(engine), _reader(rolvane), _priorState(std::move(priorState)), _ownProgram(std::move(ownProgram)) {}
+    : _engine(engine), _reader(rolvane), _absences(rolvane), _priorState(std::move(priorState)),
+      _ownProgram(std::move(ownProgram)) {}
 
 void ChangeCapture::add(CXDChangeRecords records) {
     std::move(records.begin(), records.end(), std::back_inserter(_records));
@@ -151,6 +152,7 @@ void ChangeCapture::addComparison(const Value& prior, const Value& current, cons
     GroupAddress address{guid, to.user, to.sources, std::nullopt};
     if (!prior && current) address.allGroup = allGroupAt(location, to.user);
     const GroupSteps steps = compareGroupStates(prior, current, address);
+    if (group) confirmAbsences(steps, *group);
     if (group) readNewMembers(steps, *group, current.dictionary()[kMemberUIDState].array().count());
     for (const GroupStep& step : steps) {
         if (const auto* record = std::get_if<CXDChangeRecordPtr>(&step))
@@ -161,6 +163,27 @@ void ChangeCapture::addComparison(const Value& prior, const Value& current, cons
             addGroup(std::dynamic_pointer_cast<CXGroup>(
                 _reader.rolvane().recordForUniqueId(std::get<CaptureSubgroup>(step).group)));
     }
+}
+
+// An index that has lost an entry would have everybody lose a contact.
+void ChangeCapture::confirmAbsences(const GroupSteps& steps, const CXGroup& group) {
+    const bool isCopy = group.isSubscribed();
+    const std::string location = isCopy && group.isAllGroup() ? group.remoteLocation().str() : std::string();
+    std::vector<UniqueId> left;
+    for (const GroupStep& step : steps) {
+        const auto* record = std::get_if<CXDChangeRecordPtr>(&step);
+        if (!record) continue;
+        const int32_t type = (*record)->type();
+        const bool isPerson = type == CXDRemoveRecordFromGroup;
+        if (!isPerson && type != CXDRemoveGroupFromGroup) continue;
+        const UniqueId own = cxUIDWithTableName(*(*record)->person(), isPerson ? kCXPersonTable : kCXGroupTable);
+        const UniqueId copy = cxUIDWithTableName(own, isPerson ? kCXSubscribedPersonTable : kCXSubscribedGroupTable);
+        if (group.isAllGroup())
+            _absences.requireGoneFrom(location, isCopy ? copy : own);
+        else
+            left.insert(left.end(), {own, copy});
+    }
+    _absences.requireUnlisted(group.uniqueId(), left);
 }
 
 std::optional<UniqueId> ChangeCapture::allGroupAt(const RemoteLocation& location, const UserName& user) const {

@@ -3,6 +3,7 @@
 #include "conduits/ConduitEngine.h"
 #include "conduits/ContactReader.h"
 #include "conduits/GroupComparison.h"
+#include "contacts/DamagedDatabase.h"
 #include "foundation/NumberTable.h"
 #include "model/CXDChangeRecord.h"
 
@@ -28,7 +29,8 @@ public:
     // person that is new also enters the location's all-contacts group.
     void addPerson(const CXRow& person, bool update);
     void addPerson(const std::optional<CXRow>& person, bool update);
-    // What the group's location has to learn. None, and a group that is shared nowhere, add nothing.
+    // What the group's location has to learn. None, and a group that is shared nowhere, add nothing. Throws
+    // CXDamagedDatabase where something would count as gone that is there.
     void addGroup(const CXGroupRef& group);
     // `group` is the group that the states are of, when there is one: its new members are then read together.
     void addComparison(const Value& prior, const Value& current, const UniqueId& guid, const RemoteLocation& location,
@@ -65,9 +67,11 @@ private:
     void addMember(const UniqueId& member);
     void readNewMembers(const GroupSteps& steps, const CXGroup& group, size_t members); // members: of the group now
     bool cameFromPublisher(const CXRow& person) const;
+    void confirmAbsences(const GroupSteps& steps, const CXGroup& group); // else CXDamagedDatabase
 
     ConduitEngine& _engine;
     ContactReader _reader;
+    AbsenceCheck _absences;
     Dictionary _priorState;
     const std::string _ownProgram;
     CXDChangeRecords _records;

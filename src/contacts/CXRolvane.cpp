@@ -1,5 +1,6 @@
 #include "contacts/CXRolvane.h"
 
+#include "contacts/DamagedDatabase.h"
 #include "contacts/RolvaneImpl.h"
 #include "foundation/Log.h"
 #include "foundation/Paths.h"
@@ -30,24 +31,40 @@ CXRolvane::Options filledIn(CXRolvane::Options options) {
 CXRolvane::Impl::Impl(CXRolvane& owner, Options given)
     : face(owner), options(filledIn(std::move(given))), clock(options.clock ? *options.clock : Clock::system()),
       center(options.center ? *options.center : NotificationCenter::defaultCenter()),
-      sqlite(options.path, options.busyTimeoutMilliseconds), store(sqlite), journal(sqlite), identity(store.identity()),
-      anchor(std::make_shared<CXRolvane* const>(&owner)) {}
+      sqlite(RecordStore::makeIfMissing(options.path, options.busyTimeoutMilliseconds),
+             options.busyTimeoutMilliseconds),
+      store(sqlite), journal(sqlite), identity(store.identity()), anchor(std::make_shared<CXRolvane* const>(&owner)) {}
 
 CXRolvane::CXRolvane(Options options) : _impl(std::make_unique<Impl>(*this, std::move(options))) {
     if (!_impl->options.runLoop) return;
     _impl->cursor();
     _impl->watcher = std::make_unique<ChangeWatcher>(*_impl->options.runLoop, _impl->options.distributed,
-                                                     _impl->options.path, [this] { deliverExternalChanges(); });
+                                                     _impl->options.path, [this] {
+                                                         try {
+                                                             deliverExternalChanges();
+                                                         } catch (const CXDamagedDatabase& e) {
+                                                             CXLog("What other programs have saved waits: %@", e);
+                                                         }
+                                                     });
     ChangeWatcher::touch(_impl->options.path); // what came while nobody watched is delivered in the first turn
 }
 
 CXRolvane::~CXRolvane() = default;
 
+void CXRolvane::Impl::isMissing(const std::string& what) {
+    const std::string told =
+        "The contact database " + options.path + " is damaged: " + what + " cannot be found in it.";
+    sqlite.noteDamage(told);
+    throw CXDamagedDatabase(told);
+}
+
 // Records --------------------------------------------------------------------------------------------------------
 
 CXAllGroupRef CXRolvane::allGroup() {
     std::lock_guard lock(_impl->mutex);
-    return _impl->handleAs<CXAllGroup>(UniqueId(kCXAllGroupUID));
+    CXAllGroupRef group = _impl->handleAs<CXAllGroup>(UniqueId(kCXAllGroupUID));
+    if (!group) _impl->isMissing("the list of all contacts");
+    return group;
 }
 
 CXAllGroupRef CXRolvane::allGroupForRemoteLocation(const RemoteLocation& location) {
@@ -61,8 +78,10 @@ CXAllGroupRef CXRolvane::allGroupForRemoteLocation(const RemoteLocation& locatio
 std::vector<CXSubscriptionRef> CXRolvane::subscriptions() {
     std::lock_guard lock(_impl->mutex);
     std::vector<CXSubscriptionRef> all;
-    for (const UniqueId& uid : _impl->recordsOf(RecordKind::subscription, std::nullopt))
+    for (const UniqueId& uid : _impl->recordsOf(RecordKind::subscription, std::nullopt)) {
         all.push_back(_impl->handleAs<CXSubscription>(uid));
+        if (!all.back()) _impl->isMissing("the subscription " + uid.str());
+    }
     return all;
 }
 

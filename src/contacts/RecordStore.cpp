@@ -1,12 +1,19 @@
 #include "contacts/RecordStore.h"
 
+#include "contacts/DamagedDatabase.h"
 #include "foundation/Paths.h"
 #include "foundation/PropertyList.h"
 
 #include <algorithm>
+#include <atomic>
+#include <cerrno>
 #include <chrono>
+#include <cstring>
+#include <fcntl.h>
 #include <map>
+#include <sys/stat.h>
 #include <thread>
+#include <unistd.h>
 
 namespace rolvane {
 
@@ -96,6 +103,35 @@ CXRow rowOf(Sqlite::Statement& s) {
 }
 
 } // namespace
+
+const std::string& RecordStore::makeIfMissing(const std::string& path, int busyTimeoutMilliseconds) {
+    struct stat there {};
+    if (::stat(path.c_str(), &there) == 0) {
+        if (S_ISREG(there.st_mode) && there.st_size == 0)
+            throw CXException(kCXDatabaseException,
+                              "The contact database " + path +
+                                  " is empty (0 bytes): what stood in it is lost. Put a backup in "
+                                  "its place, or begin anew with `rolvane new-database`.");
+        return path;
+    }
+    if (errno != ENOENT) return path; // the opening says why
+    static std::atomic<int> made = 0;
+    const std::string fresh = path + ".new." + std::to_string(::getpid()) + "." + std::to_string(++made);
+    {
+        Sqlite database(fresh, busyTimeoutMilliseconds);
+        const RecordStore filled(database);
+    }
+    // Never over another process's, which was faster.
+    int failed = ::link(fresh.c_str(), path.c_str()) == 0 ? 0 : errno;
+    if (failed != 0 && failed != EEXIST) // a file system without links
+        failed = ::renameat2(AT_FDCWD, fresh.c_str(), AT_FDCWD, path.c_str(), RENAME_NOREPLACE) == 0 ? 0 : errno;
+    ::unlink(fresh.c_str());
+    if (failed != 0 && failed != EEXIST)
+        throw CXException(kCXDatabaseException, "Could not make the contact database " + path + ": " +
+                                                    std::strerror(failed) +
+                                                    ". Check the permissions of its directory.");
+    return path;
+}
 
 RecordStore::RecordStore(Sqlite& database) : _database(database) {
     makeOrCheckFormat();
@@ -321,7 +357,11 @@ std::vector<CXRow> RecordStore::scan(RecordKind kind, ScanPosition& position, in
     const double date = position.modified;
     const auto take = [&](Sqlite::Statement& s) {
         while (s.step()) {
-            position = {s.real(4), s.integer(0)};
+            const ScanPosition next{s.real(4), s.integer(0)};
+            const bool isBehind =
+                next.modified > position.modified || (next.modified == position.modified && next.id > position.id);
+            if (!isBehind) outOfOrder();
+            position = next;
             ids.push_back(position.id);
             rows.push_back(rowOf(s));
         }
@@ -362,11 +402,20 @@ std::vector<CXRow> RecordStore::scanByAge(RecordKind kind, const std::optional<s
     return rowsWithParents(s, 0, position);
 }
 
+// A scan that does not move on would never end.
+void RecordStore::outOfOrder() {
+    const std::string told = "The contact database " + _database.path() + " is damaged: an index is out of order.";
+    _database.noteDamage(told);
+    throw CXDamagedDatabase(told);
+}
+
 std::vector<CXRow> RecordStore::rowsWithParents(Sqlite::Statement& s, int positionColumn, int64_t& position) {
     std::vector<CXRow> rows;
     std::vector<int64_t> ids;
     while (s.step()) {
-        position = s.integer(positionColumn);
+        const int64_t next = s.integer(positionColumn);
+        if (next <= position) outOfOrder();
+        position = next;
         ids.push_back(s.integer(0));
         rows.push_back(rowOf(s));
     }

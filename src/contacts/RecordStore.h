@@ -4,7 +4,9 @@
 #include "contacts/RecordKind.h"
 #include "contacts/Sqlite.h"
 
+#include <array>
 #include <functional>
+#include <set>
 
 namespace rolvane {
 
@@ -35,6 +37,9 @@ struct ScanPosition {
 // want an open transaction. Not locked. Row numbers grow with age and are never used again.
 class RecordStore {
 public:
+    // A file that is missing is made elsewhere and put in its place when it is a whole database, so that no empty file
+    // is ever anybody's beginning. Gives the path.
+    static const std::string& makeIfMissing(const std::string& path, int busyTimeoutMilliseconds);
     // Makes the tables in a new file. Refuses files of a newer format and files that are no contact database.
     explicit RecordStore(Sqlite& database);
 
@@ -76,6 +81,28 @@ public:
     };
     void forEachLine(RecordKind kind, const std::function<void(Line)>& call);
 
+    // Past the indexes, or by one of them alone: for finding out which of them is damaged --------------------------
+    struct TableRow {
+        int64_t id;
+        std::string uid;
+        RecordKind kind;
+        std::string location;
+        Bytes properties;
+    };
+    void forEachRowOfTable(const std::function<void(const TableRow&)>& call, bool withProperties = false);
+    enum class Index { identifiers, names, locations }; // of records, each of which names the row and its identifier
+    static constexpr std::array kIndexesOfRecords{Index::identifiers, Index::names, Index::locations};
+    void forEachOfIndex(Index index, const std::function<void(int64_t id, std::string uid)>& call);
+    std::set<std::pair<int64_t, int64_t>> listsOfTable(); // group and member
+    struct ListsOfIndex {
+        bool isReadable = true, isInOrder = true;
+        std::set<std::pair<int64_t, int64_t>> pairs; // group and member
+    };
+    ListsOfIndex listsOfIndex();
+    // The first of them whom the group lists after all.
+    std::optional<UniqueId> firstListedAfterAll(const UniqueId& group, const std::vector<UniqueId>& members);
+    std::string whatIsWrong(); // SQLite's own check of the whole file; "" when it finds nothing
+
     // Within a transaction ---------------------------------------------------------------------------------------
     void insertRow(const UniqueId& uid, RecordKind kind, const Dictionary& properties, const Bytes& encoded,
                    Date created, const std::string& writer);
@@ -97,6 +124,7 @@ private:
     int64_t addWriters(); // the format then
     int64_t addNames();
     void fillNewDatabase();
+    [[noreturn]] void outOfOrder();
     std::vector<CXRow> rowsWithParents(Sqlite::Statement& s, int positionColumn, int64_t& position);
     void addParents(std::vector<CXRow>& rows, const std::vector<int64_t>& ids);
 

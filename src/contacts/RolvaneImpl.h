@@ -39,6 +39,8 @@ struct CXRolvane::Impl {
 
     // CXException when the path names another file by now: what is read is of the past, what is saved would be lost.
     void requireSameFile() const;
+    // What every database has cannot be found.
+    [[noreturn]] void isMissing(const std::string& what);
 
     // Handles
     CXRecordRef handle(const UniqueId& uid); // null when there is no such record

@@ -1,5 +1,7 @@
 #include "contacts/Sqlite.h"
 
+#include "contacts/DamagedDatabase.h"
+
 #include <fcntl.h>
 #include <sqlite3.h>
 #include <sys/stat.h>
@@ -33,6 +35,11 @@ std::string explanation(int extendedCode, const std::string& detail) {
     }
 }
 
+bool isDamage(int extendedCode) {
+    const int code = extendedCode & 0xff;
+    return code == SQLITE_CORRUPT || code == SQLITE_NOTADB;
+}
+
 // The mode holds whatever the umask is; an existing file keeps its own.
 void makePrivateFile(const std::string& path) {
     int fd = ::open(path.c_str(), O_RDWR | O_CREAT | O_EXCL | O_CLOEXEC, 0600);
@@ -45,8 +52,10 @@ void makePrivateFile(const std::string& path) {
 
 void throwSqliteError(sqlite3* handle, int code, const std::string& path, std::string_view doing) {
     std::string detail = handle ? sqlite3_errmsg(handle) : sqlite3_errstr(code);
-    throw CXException(kCXDatabaseException, "Could not " + std::string(doing) + " the contact database " + path + ": " +
-                                                explanation(code, detail));
+    const std::string told =
+        "Could not " + std::string(doing) + " the contact database " + path + ": " + explanation(code, detail);
+    if (isDamage(code)) throw CXDamagedDatabase(told);
+    throw CXException(kCXDatabaseException, told);
 }
 
 struct Sqlite::Prepared {
@@ -66,6 +75,15 @@ Sqlite::Sqlite(const std::string& path, int busyTimeoutMilliseconds) : _path(pat
     sqlite3_busy_timeout(_handle, busyTimeoutMilliseconds);
 }
 
+void Sqlite::fail(int code, std::string_view doing) {
+    try {
+        throwSqliteError(_handle, code, _path, doing);
+    } catch (const CXDamagedDatabase& e) {
+        _damage = e.reason();
+        throw;
+    }
+}
+
 Sqlite::~Sqlite() {
     _prepared.clear();
     // Of a file that has moved SQLite leaves the log alone: its path may belong to a successor by now.
@@ -76,7 +94,7 @@ std::shared_ptr<Sqlite::Prepared> Sqlite::prepare(std::string_view sql) {
     auto made = std::make_shared<Prepared>();
     int code = sqlite3_prepare_v3(_handle, sql.data(), static_cast<int>(sql.size()), SQLITE_PREPARE_PERSISTENT,
                                   &made->statement, nullptr);
-    if (code != SQLITE_OK) throwSqliteError(_handle, code, _path, "read");
+    if (code != SQLITE_OK) fail(code, "read");
     return made;
 }
 
@@ -89,7 +107,7 @@ Sqlite::Statement Sqlite::statement(std::string_view sql) {
 
 void Sqlite::execute(const std::string& sql) {
     int code = sqlite3_exec(_handle, sql.c_str(), nullptr, nullptr, nullptr);
-    if (code != SQLITE_OK) throwSqliteError(_handle, code, _path, "use");
+    if (code != SQLITE_OK) fail(code, "use");
 }
 
 int64_t Sqlite::integer(std::string_view sql) {
@@ -127,7 +145,7 @@ void Sqlite::Statement::reset() {
 void Sqlite::Statement::check(int code) const {
     if (code == SQLITE_OK) return;
     bool writing = _database._writing || !sqlite3_stmt_readonly(_prepared->statement);
-    throwSqliteError(_database._handle, code, _database._path, writing ? "write to" : "read");
+    _database.fail(code, writing ? "write to" : "read");
 }
 
 Sqlite::Statement& Sqlite::Statement::bind(int index, int64_t value) {

@@ -14,7 +14,7 @@ struct sqlite3_stmt;
 namespace rolvane {
 
 // Turns a failure of SQLite into a CXException kCXDatabaseException: what could not be done, with which file, why, and
-// what to do. The only place that knows SQLite's error codes.
+// what to do; a damaged file is a CXDamagedDatabase. The only place that knows SQLite's error codes.
 [[noreturn]] void throwSqliteError(sqlite3* handle, int code, const std::string& path, std::string_view doing);
 
 // One connection. Not locked: its owner sees to it that one thread at a time uses it. Every failure throws.
@@ -67,14 +67,21 @@ public:
     int64_t lastInsertId() const;
     const std::string& path() const { return _path; }
 
+    // What SQLite, or whoever compared what it says, has found damaged in the file; "" when nothing was.
+    const std::string& damage() const { return _damage; }
+    void noteDamage(const std::string& what) { _damage = what; }
+    void forgetDamage() { _damage.clear(); }
+
 private:
     friend class Statement;
     friend class SqliteTransaction;
     friend class SqliteSnapshot;
     std::shared_ptr<Prepared> prepare(std::string_view sql);
+    [[noreturn]] void fail(int code, std::string_view doing);
 
     std::string _path;
     sqlite3* _handle = nullptr;
+    std::string _damage;
     bool _writing = false; // a write transaction is open: what fails now is the writing
     std::map<std::string, std::shared_ptr<Prepared>, std::less<>> _prepared;
 };

@@ -6,6 +6,7 @@
 #include "contacts/CXAllGroup.h"
 #include "contacts/CXRolvane.h"
 #include "contacts/CXUserDefaults.h"
+#include "contacts/DamagedDatabase.h"
 #include "daemon/BootTimer.h"
 #include "daemon/CXDProgressManager.h"
 #include "daemon/CheckIn.h"
@@ -97,6 +98,7 @@ public:
         options.program = "RolvaneManager";
         options.distributed = &_channel;
         options.runLoop = &_loop;
+        requireKnownDatabase(options.path, Preferences::shared());
         CXRolvane::configureShared(options);
         CXRolvane::sharedRolvane().recoverShareCount(Preferences::shared());
         CXDSyncEngine::setMaker([this] { return makeEngine(); });

@@ -2,7 +2,9 @@
 
 #include "contacts/CXMerger.h"
 #include "contacts/CXRolvane.h"
+#include "contacts/DamagedDatabase.h"
 #include "engine/ApplyLoop.h"
+#include "engine/DatabaseCare.h"
 #include "engine/EngineParts.h"
 #include "engine/PayloadMerging.h"
 #include "engine/PublicationCache.h"
@@ -156,8 +158,14 @@ void CXDSyncEngine::runPass(PassKind kind, std::function<void()> pass) {
         const Running running(_passRunning);
         _parts->outcomes.begin(kind.full, kind.retry);
         try {
-            pass();
+            // What cannot be believed is not told to anybody. Whoever delivers changes must not take them for done.
+            if (mendDatabase(*_parts))
+                pass();
+            else if (!kind.full)
+                throw CXDamagedDatabase("The changes wait until the contact database is in order.");
+            meetsDamage(*_parts);
         } catch (const CXException& e) {
+            meetsDamage(*_parts);
             _parts->outcomes.caught(e.reason());
             endPass(*_parts);
             throw;
@@ -198,6 +206,11 @@ void CXDSyncEngine::makePass(bool allowRetry, bool isRetry) {
         forgetFormerSubscriptions(*_parts);
         _parts->with.progress.startedPhase(1);
         CXDChangeRecords gathered = gather();
+        if (!damageOf(_parts->with.rolvane).empty()) { // what was gathered may name as gone what is there
+            _parts->with.progress.stop();
+            if (allowRetry) scheduleRetry(); // which begins with a repair
+            return;
+        }
         // Nothing has been changed yet, and the next process finds the same again.
         if (terminationRequested()) {
             unlockAllURLs();

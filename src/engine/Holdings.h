@@ -2,6 +2,7 @@
 
 #include "contacts/CXRolvane.h"
 #include "contacts/Constants.h"
+#include "contacts/DamagedDatabase.h"
 #include "contacts/Identifier.h"
 #include "engine/ChangeQueue.h"
 
@@ -16,10 +17,10 @@ inline bool isPublished(const CXGroup& group) {
 }
 
 // What the database still holds, under the own table or that of the subscribed copies; each identifier is asked for
-// once.
+// once. What it does not hold is withdrawn from the store, so a damaged database throws CXDamagedDatabase.
 class Holdings {
 public:
-    explicit Holdings(CXRolvane& rolvane) : _rolvane(rolvane) {}
+    explicit Holdings(CXRolvane& rolvane) : _rolvane(rolvane), _absences(rolvane) {}
     bool person(const UniqueId& uid) { return holds(uid, kCXPersonTable, kCXSubscribedPersonTable); }
     bool group(const UniqueId& uid) {
         return uid.str() == kCXAllGroupUID || uid == kPeopleGroup || holds(uid, kCXGroupTable, kCXSubscribedGroupTable);
@@ -28,12 +29,15 @@ public:
 private:
     bool holds(const UniqueId& uid, std::string_view table, std::string_view tableOfCopies) {
         const auto [known, isNew] = _known.try_emplace(uid);
-        if (isNew)
-            known->second = _rolvane.recordForUniqueId(cxUIDWithTableName(uid, table)) ||
-                            _rolvane.recordForUniqueId(cxUIDWithTableName(uid, tableOfCopies));
+        if (!isNew) return known->second;
+        const UniqueId own = cxUIDWithTableName(uid, table), copy = cxUIDWithTableName(uid, tableOfCopies);
+        known->second = _rolvane.recordForUniqueId(own) || _rolvane.recordForUniqueId(copy);
+        if (!known->second)
+            for (const UniqueId& form : {own, copy}) _absences.requireGone(form);
         return known->second;
     }
     CXRolvane& _rolvane;
+    AbsenceCheck _absences;
     std::unordered_map<UniqueId, bool> _known;
 };
 

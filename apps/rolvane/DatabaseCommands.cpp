@@ -1,0 +1,23 @@
+#include "Context.h"
+
+#include "contacts/DamagedDatabase.h"
+#include "daemon/DaemonControl.h"
+
+namespace rolvane::cli {
+
+// The store keeps what was published: nothing of the new database is known to be its former contents, so nothing is
+// deleted there, and the daemon forgets what it knew when it meets another database.
+void addDatabaseCommands(CLI::App& app, Context& context) {
+    addCommand(
+        app, context, "new-database",
+        "Begin with an empty contact database where the former one is gone. What is published stays on the store "
+        "until it is published anew",
+        {}, [&context] {
+            DaemonControl().stop();
+            beginNewDatabase({});
+            context.say("A new contact database was made. Import a backup with `rolvane import`, and publish and "
+                        "subscribe anew.");
+        });
+}
+
+} // namespace rolvane::cli
