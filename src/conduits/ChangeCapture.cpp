@@ -170,6 +170,7 @@ void ChangeCapture::confirmAbsences(const GroupSteps& steps, const CXGroup& grou
     const bool isCopy = group.isSubscribed();
     const std::string location = isCopy && group.isAllGroup() ? group.remoteLocation().str() : std::string();
     std::vector<UniqueId> left;
+    bool isLocated = false;
     for (const GroupStep& step : steps) {
         const auto* record = std::get_if<CXDChangeRecordPtr>(&step);
         if (!record) continue;
@@ -178,11 +179,18 @@ void ChangeCapture::confirmAbsences(const GroupSteps& steps, const CXGroup& grou
         if (!isPerson && type != CXDRemoveGroupFromGroup) continue;
         const UniqueId own = cxUIDWithTableName(*(*record)->person(), isPerson ? kCXPersonTable : kCXGroupTable);
         const UniqueId copy = cxUIDWithTableName(own, isPerson ? kCXSubscribedPersonTable : kCXSubscribedGroupTable);
+        if (isCopy && !std::exchange(isLocated, true)) _absences.requireItsLocation(group.uniqueId());
         if (group.isAllGroup())
             _absences.requireGoneFrom(location, isCopy ? copy : own);
         else
-            left.insert(left.end(), {own, copy});
+            for (const UniqueId& form : {own, copy}) left.push_back(form);
     }
+    if (left.empty()) return;
+    // Where a group lists both, one may leave it and the other stay.
+    const std::vector<UniqueId> people = group.memberUniqueIds(), subgroups = group.subgroupUniqueIds();
+    std::unordered_set<UniqueId> listed(people.begin(), people.end());
+    listed.insert(subgroups.begin(), subgroups.end());
+    std::erase_if(left, [&](const UniqueId& form) { return listed.contains(form); });
     _absences.requireUnlisted(group.uniqueId(), left);
 }
 

@@ -57,9 +57,13 @@ const AbsenceCheck::Rows& AbsenceCheck::rows() {
 }
 
 void AbsenceCheck::contradiction(const std::string& what) {
+    damaged(what + " is there, and an index of the file does not know it");
+}
+
+void AbsenceCheck::damaged(const std::string& how) {
     CXRolvane::Impl& d = _rolvane.impl();
-    const std::string told = "The contact database " + d.options.path + " is damaged: " + what +
-                             " is there, and an index of the file does not know it. Nothing is taken for deleted.";
+    const std::string told =
+        "The contact database " + d.options.path + " is damaged: " + how + ". Nothing is taken for deleted.";
     d.sqlite.noteDamage(told);
     throw CXDamagedDatabase(told);
 }
@@ -75,6 +79,14 @@ void AbsenceCheck::requireGoneFrom(std::string_view location, const UniqueId& ui
     if (_rolvane.impl().work.isRecordWithChanges(uid)) return;
     const auto found = rows().locations.find(uid.str());
     if (found != rows().locations.end() && found->second == location) contradiction(uid.str());
+}
+
+void AbsenceCheck::requireItsLocation(const UniqueId& uid) {
+    CXRolvane::Impl& d = _rolvane.impl();
+    std::lock_guard lock(d.mutex);
+    const auto& row = d.storedRow(uid);
+    if (row && locationOf(row->kind, d.storedProperties(uid)) != row->location)
+        damaged(uid.str() + " has two locations");
 }
 
 void AbsenceCheck::requireUnlisted(const UniqueId& group, const std::vector<UniqueId>& members) {

@@ -34,6 +34,8 @@ public:
     void requireGone(const UniqueId& uid);
     // No record of the location has the identifier; the empty location is the owner's own.
     void requireGoneFrom(std::string_view location, const UniqueId& uid);
+    // The record stands under the location that its properties name: whoever is looked for there is of that location.
+    void requireItsLocation(const UniqueId& uid);
     // The group does not list any of them: identifiers as in the database.
     void requireUnlisted(const UniqueId& group, const std::vector<UniqueId>& members);
 
@@ -41,6 +43,7 @@ private:
     struct Rows;
     const Rows& rows();
     [[noreturn]] void contradiction(const std::string& what);
+    [[noreturn]] void damaged(const std::string& how);
 
     CXRolvane& _rolvane;
     std::unique_ptr<Rows> _rows;

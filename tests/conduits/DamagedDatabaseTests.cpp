@@ -44,7 +44,7 @@ public:
     }
 
     struct Seen {
-        std::set<int32_t> removals; // types
+        std::set<std::string> removals;
         bool damaged = false, repaired = false;
         std::string told;
     };
@@ -65,7 +65,7 @@ public:
                 daemons.open();
                 for (const CXDChangeRecordPtr& record : daemons.changeRecords())
                     if ((record->type() & kCXDRemovalBit) != 0 && record->type() != CXDRemoveDistributionListFromGroup)
-                        seen.removals.insert(record->type());
+                        seen.removals.insert(record->description());
                 if (seen.damaged) seen.repaired = true;
                 return seen;
             } catch (const CXException& e) {
@@ -118,7 +118,7 @@ TEST_F(DamagedDatabase, WhateverIsDamagedNoContactAndNoGroupIsToldToBeGone) {
     for (unsigned seed = 1; seed <= count; ++seed) {
         std::mt19937 random(seed);
         const Seen seen = scan(damaged(sound, random));
-        EXPECT_TRUE(seen.removals.empty()) << "seed " << seed << ", type " << *seen.removals.begin();
+        EXPECT_TRUE(seen.removals.empty()) << "seed " << seed << ": " << *seen.removals.begin();
         met += seen.damaged;
         mended += seen.repaired;
     }
