@@ -4,6 +4,8 @@
 #include "contacts/CXGroup.h"
 #include "contacts/CXPerson.h"
 #include "contacts/CXSubscription.h"
+#include "contacts/CommonVersions.h"
+#include "contacts/ConflictLog.h"
 #include "foundation/Notification.h"
 #include "foundation/RunLoop.h"
 
@@ -139,6 +141,23 @@ public:
     bool hasUnsavedChanges() const;
     size_t unsavedSize() const; // bytes of content that wait in memory for the save, roughly
     void rollback();            // drops the unsaved changes; handles of records that were only added become empty
+
+    // Two people's edits of one contact ------------------------------------------------------------------------------
+    // From the first edit of a contact that a store has had, until that edit is sent, the database keeps the contact as
+    // both had it (contacts/ContactMerge.h merges against that). An edit is every save but one that says itself what both
+    // have.
+    //
+    // Nothing: no store is known to have had the contact.
+    std::optional<CXCommonVersion> commonVersion(const UniqueId& uid);
+    // Both sides have had these encoded properties. Part of the unit of work. Any thread.
+    void setCommonVersion(const UniqueId& uid, std::shared_ptr<const Bytes> properties);
+    std::vector<UniqueId> editedSinceCommon(); // contacts with edits that were not sent, oldest first
+    // Values that gave way to others: noted with the next save, or durably on return.
+    void noteConflicts(const UniqueId& uid, const std::vector<CXMergeConflict>& conflicts);
+    void noteConflictsAtOnce(const UniqueId& uid, const std::vector<CXMergeConflict>& conflicts); // any thread
+    std::vector<CXConflict> conflicts(); // those that are saved, oldest first
+    std::optional<CXConflict> conflict(int64_t number);
+    bool forgetConflict(int64_t number); // durable on return; false when there is none
 
     // Identity and share count -----------------------------------------------------------------------------------
     // Made with the file, kept through everything but a new file.

@@ -1,5 +1,7 @@
 #include "contacts/RecordStore.h"
 
+#include "contacts/CommonVersions.h"
+#include "contacts/ConflictLog.h"
 #include "contacts/DamagedDatabase.h"
 #include "foundation/Paths.h"
 #include "foundation/PropertyList.h"
@@ -19,7 +21,7 @@ namespace rolvane {
 
 namespace {
 
-constexpr int kFormat = 3;
+constexpr int kFormat = 4;
 constexpr int64_t kApplicationId = 0x52564c43; // "RVLC"
 
 constexpr const char* kTables = R"(
@@ -156,6 +158,7 @@ void RecordStore::makeOrCheckFormat() {
     int64_t format = _database.integer("PRAGMA user_version");
     if (format == 1) format = addWriters();
     if (format == 2) format = addNames();
+    if (format == 3) format = addCommonVersions();
     if (format > kFormat)
         throw CXException(kCXDatabaseException, "The contact database " + _database.path() +
                                                     " was written by a newer version (format " +
@@ -183,8 +186,17 @@ int64_t RecordStore::addNames() {
     return _database.integer("PRAGMA user_version");
 }
 
+// Format 3 did not keep what an edited contact was before. Nothing is known of what stores have had by then.
+int64_t RecordStore::addCommonVersions() {
+    SqliteTransaction transaction(_database);
+    if (_database.integer("PRAGMA user_version") == 3) // nobody else did it meanwhile
+        _database.execute(std::string(CommonVersions::kTable) + ConflictLog::kTable + "PRAGMA user_version=4;");
+    transaction.commit();
+    return _database.integer("PRAGMA user_version");
+}
+
 void RecordStore::fillNewDatabase() {
-    _database.execute(kTables);
+    _database.execute(std::string(kTables) + CommonVersions::kTable + ConflictLog::kTable);
     _database.execute("PRAGMA application_id=" + std::to_string(kApplicationId));
     _database.execute("PRAGMA user_version=" + std::to_string(kFormat));
     _database.statement("INSERT INTO meta VALUES('identity', ?)").bind(1, makeUUID()).run();

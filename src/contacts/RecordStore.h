@@ -123,6 +123,7 @@ private:
     void makeOrCheckFormat();
     int64_t addWriters(); // the format then
     int64_t addNames();
+    int64_t addCommonVersions();
     void fillNewDatabase();
     [[noreturn]] void outOfOrder();
     std::vector<CXRow> rowsWithParents(Sqlite::Statement& s, int positionColumn, int64_t& position);

@@ -2,6 +2,8 @@
 
 #include "contacts/CXRolvane.h"
 #include "contacts/ChangeWatcher.h"
+#include "contacts/CommonVersions.h"
+#include "contacts/ConflictLog.h"
 #include "contacts/Journal.h"
 #include "contacts/RecordStore.h"
 #include "contacts/SharedForms.h"
@@ -25,6 +27,8 @@ struct CXRolvane::Impl {
     Sqlite sqlite;
     RecordStore store;
     Journal journal;
+    CommonVersions commonVersions;
+    ConflictLog conflicts;
     UnitOfWork work;
     std::string identity;
     std::shared_ptr<CXRolvane* const> anchor; // handles hold it weakly

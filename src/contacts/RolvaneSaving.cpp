@@ -1,5 +1,6 @@
 // One save: one transaction, one journal entry a record, one signal.
 
+#include "contacts/ContactMerge.h"
 #include "contacts/RolvaneImpl.h"
 
 #include "foundation/Log.h"
@@ -14,8 +15,10 @@ namespace {
 // Writes a unit of work into an open transaction.
 class Saver {
 public:
-    Saver(RecordStore& store, Journal& journal, const std::string& identity, const std::string& program, Date date)
-        : _store(store), _journal(journal), _identity(identity), _program(program), _date(date) {}
+    Saver(CXRolvane::Impl& database, Date date)
+        : _store(database.store), _journal(database.journal), _commonVersions(database.commonVersions),
+          _conflicts(database.conflicts), _identity(database.identity), _program(database.options.program),
+          _date(date) {}
 
     void write(const UnitOfWork& work) {
         _work = &work;
@@ -25,6 +28,8 @@ public:
         for (const auto& [uid, record] : records)
             if (!record->deleted) writeRecord(uid, *record);
         writeMemberships(work.memberships());
+        for (const auto& [uid, properties] : work.commonVersions()) _commonVersions.set(uid, *properties);
+        for (const CXConflict& conflict : work.conflicts()) _conflicts.note(conflict);
         if (work.shareCount()) _store.setShareCount(*work.shareCount());
         if (_save) _journal.prune();
     }
@@ -85,10 +90,20 @@ private:
         return once && _store.firstOfLocation(record.kind, record.location).has_value();
     }
 
-    // A replacement that another process has overtaken: the properties that it changed stay as it left them.
-    static Dictionary withChangesOfOthers(const Dictionary& ours, const PendingRecord& record, const StoredRow& row) {
+    // A replacement that another process has overtaken: what it changed stays as it left it.
+    Dictionary withChangesOfOthers(const Dictionary& ours, const PendingRecord& record, const StoredRow& row) {
         const Dictionary before = BinaryValue::decode(*record.replacedRow).dictionary();
         const Dictionary theirs = BinaryValue::decode(*row.properties).dictionary();
+        if (isPerson(record.kind)) {
+            CXMergeResult merge = mergedContact(before, theirs, ours, CXSide::ours);
+            Dictionary& contact = merge.contact;
+            for (CXMergeConflict& each : merge.conflicts)
+                _conflicts.note({0, row.uid, deriveColumns(row.kind, contact).display, _date, std::move(each)});
+            const bool moved = theirs[kCXRemoteLocationProperty] != before[kCXRemoteLocationProperty];
+            if (const Value& place = (moved ? theirs : ours)[kCXRemoteLocationProperty])
+                contact.set(kCXRemoteLocationProperty, place);
+            return contact;
+        }
         Dictionary all = ours.mutableCopy();
         for (const auto& [property, value] : theirs)
             if (value != before[property]) all.set(property, value);
@@ -108,6 +123,8 @@ private:
         if (changedMeanwhile) after = withChangesOfOthers(after, record, row);
         Bytes encoded = changedMeanwhile ? BinaryValue::encode(after) : encodedOf(record, after);
         if (encoded == *row.properties && record.kind == row.kind) return; // nothing has changed after all
+        if (isPerson(row.kind) && !_work->commonVersions().contains(uid))
+            _commonVersions.keep(row.id, *row.properties, _date);
         _store.updateRow(row.id, record.kind, after, encoded, _date,
                          changedMeanwhile ? row.writer : _program); // it holds an edit of theirs
         note(record.kind == RecordKind::allGroup ? UniqueId(_identity + ":" + std::string(kCXInfoTable)) : uid,
@@ -180,6 +197,8 @@ private:
 
     RecordStore& _store;
     Journal& _journal;
+    CommonVersions& _commonVersions;
+    ConflictLog& _conflicts;
     const std::string& _identity;
     const std::string& _program;
     Date _date;
@@ -203,7 +222,7 @@ void CXRolvane::Impl::save() {
     bool changedRecords;
     {
         SqliteTransaction transaction(sqlite);
-        Saver saver(store, journal, identity, options.program, clock.now());
+        Saver saver(*this, clock.now());
         saver.write(work);
         transaction.commit();
         changedRecords = saver.changedRecords();

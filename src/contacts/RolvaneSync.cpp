@@ -55,6 +55,73 @@ void CXRolvane::recoverShareCount(Preferences& preferences) {
     ShareCountBump(*this, preferences).recover();
 }
 
+// Two people's edits of one contact -------------------------------------------------------------------------------
+
+std::optional<CXCommonVersion> CXRolvane::commonVersion(const UniqueId& uid) {
+    std::lock_guard lock(_impl->mutex);
+    std::optional<CXCommonVersion> stored = _impl->commonVersions.of(uid);
+    const auto& unsaved = _impl->work.commonVersions();
+    const auto found = unsaved.find(uid);
+    if (found == unsaved.end()) return stored;
+    CXCommonVersion version{found->second, stored ? stored->edited : std::nullopt};
+    if (const auto now = _impl->encoded(uid); now && *now == *version.properties) version = {};
+    return version;
+}
+
+void CXRolvane::setCommonVersion(const UniqueId& uid, std::shared_ptr<const Bytes> properties) {
+    std::lock_guard lock(_impl->mutex);
+    _impl->work.setCommonVersion(uid, std::move(properties));
+}
+
+std::vector<UniqueId> CXRolvane::editedSinceCommon() {
+    std::lock_guard lock(_impl->mutex);
+    return _impl->commonVersions.edited();
+}
+
+namespace {
+
+std::vector<CXConflict> dated(CXRolvane::Impl& database, const UniqueId& uid,
+                              const std::vector<CXMergeConflict>& conflicts) {
+    std::vector<CXConflict> all;
+    const auto person = database.handleAs<CXPerson>(uid);
+    for (const CXMergeConflict& each : conflicts)
+        all.push_back({0, uid, person ? person->displayName() : std::string(), database.clock.now(), each});
+    return all;
+}
+
+} // namespace
+
+void CXRolvane::noteConflicts(const UniqueId& uid, const std::vector<CXMergeConflict>& conflicts) {
+    std::lock_guard lock(_impl->mutex);
+    for (CXConflict& each : dated(*_impl, uid, conflicts)) _impl->work.addConflict(std::move(each));
+}
+
+void CXRolvane::noteConflictsAtOnce(const UniqueId& uid, const std::vector<CXMergeConflict>& conflicts) {
+    if (conflicts.empty()) return;
+    std::lock_guard lock(_impl->mutex);
+    SqliteTransaction transaction(_impl->sqlite);
+    for (const CXConflict& each : dated(*_impl, uid, conflicts)) _impl->conflicts.note(each);
+    transaction.commit();
+}
+
+std::vector<CXConflict> CXRolvane::conflicts() {
+    std::lock_guard lock(_impl->mutex);
+    return _impl->conflicts.all();
+}
+
+std::optional<CXConflict> CXRolvane::conflict(int64_t number) {
+    std::lock_guard lock(_impl->mutex);
+    return _impl->conflicts.find(number);
+}
+
+bool CXRolvane::forgetConflict(int64_t number) {
+    std::lock_guard lock(_impl->mutex);
+    SqliteTransaction transaction(_impl->sqlite);
+    const bool done = _impl->conflicts.forget(number);
+    transaction.commit();
+    return done;
+}
+
 // Other processes' saves ---------------------------------------------------------------------------------------------
 
 int64_t CXRolvane::Impl::cursor() {

@@ -49,6 +49,8 @@ void UnitOfWork::clear() {
     _records.clear();
     _memberships.clear();
     _shareCount.reset();
+    _commonVersions.clear();
+    _conflicts.clear();
     _size = 0;
 }
 
@@ -58,6 +60,10 @@ void UnitOfWork::replace(PendingRecord& record, const Dictionary& properties) {
     record.changes.clear();
     record.whole = std::make_shared<const Bytes>(BinaryValue::encode(properties));
     _size += record.whole->size();
+}
+
+void UnitOfWork::setCommonVersion(const UniqueId& uid, std::shared_ptr<const Bytes> properties) {
+    _commonVersions[uid] = std::move(properties);
 }
 
 const PendingRecord* UnitOfWork::find(const UniqueId& uid) const {

@@ -1,5 +1,6 @@
 #pragma once
 
+#include "contacts/ConflictLog.h"
 #include "contacts/RecordKind.h"
 #include "foundation/StrongString.h"
 #include "foundation/Value.h"
@@ -54,7 +55,10 @@ struct PendingMembership {
 // The unsaved changes of a database object. Pure bookkeeping: knows no file and no lock.
 class UnitOfWork {
 public:
-    bool empty() const { return _records.empty() && _memberships.empty() && !_shareCount; }
+    bool empty() const {
+        return _records.empty() && _memberships.empty() && !_shareCount && _commonVersions.empty() &&
+               _conflicts.empty();
+    }
     void clear();
 
     const PendingRecord* find(const UniqueId& uid) const;
@@ -81,6 +85,13 @@ public:
     std::vector<std::pair<UniqueId, const PendingRecord*>> inOrder() const;
     const std::unordered_map<UniqueId, PendingRecord>& records() const { return _records; }
 
+    // By contact, the properties that both sides have had.
+    using CommonVersionsOf = std::unordered_map<UniqueId, std::shared_ptr<const Bytes>>;
+    const CommonVersionsOf& commonVersions() const { return _commonVersions; }
+    void setCommonVersion(const UniqueId& uid, std::shared_ptr<const Bytes> properties);
+    const std::vector<CXConflict>& conflicts() const { return _conflicts; }
+    void addConflict(CXConflict conflict) { _conflicts.push_back(std::move(conflict)); }
+
     const std::optional<int64_t>& shareCount() const { return _shareCount; }
     void setShareCount(int64_t count) { _shareCount = count; }
 
@@ -88,6 +99,8 @@ private:
     std::unordered_map<UniqueId, PendingRecord> _records;
     std::map<UniqueId, PendingMembership> _memberships;
     std::optional<int64_t> _shareCount;
+    CommonVersionsOf _commonVersions;
+    std::vector<CXConflict> _conflicts;
     uint64_t _nextOrder = 1;
     size_t _size = 0;
 };

@@ -28,11 +28,11 @@ std::string reasonOf(const std::function<void()>& work) {
 TEST(DatabaseFault, AFileOfANewerFormatIsRefusedAndLeftAlone) {
     TestDatabase d;
     d.database.reset();
-    Sqlite(d.path, 0).execute("PRAGMA user_version=4");
+    Sqlite(d.path, 0).execute("PRAGMA user_version=5");
     std::string told = reasonOf([&] { d.open(); });
     EXPECT_TELLS(told, "newer version");
     EXPECT_TELLS(told, d.path);
-    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 4);
+    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 5);
 }
 
 TEST(DatabaseFault, AFileOfTheFormerFormatLearnsWhoWroteWhat) {
@@ -48,7 +48,7 @@ TEST(DatabaseFault, AFileOfTheFormerFormatLearnsWhoWroteWhat) {
     d->save();
     EXPECT_EQ(d->personRow(UniqueId("A:CXPerson"))->writer, "rolvane");
     d.database.reset();
-    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 3);
+    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 4);
 }
 
 TEST(DatabaseFault, AFileOfTheFormatBeforeNamesItsGroupsMembers) {
@@ -63,7 +63,25 @@ TEST(DatabaseFault, AFileOfTheFormatBeforeNamesItsGroupsMembers) {
     EXPECT_EQ(friends->memberUniqueIds(), std::vector{UniqueId("A:CXPerson")});
     EXPECT_EQ(friends->memberCount(), 1u);
     d.database.reset();
-    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 3);
+    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 4);
+}
+
+TEST(DatabaseFault, AFileOfTheFormatBeforeKeepsWhatEditedContactsWere) {
+    TestDatabase d;
+    d.addPerson("Ada", "A:CXPerson");
+    d->save();
+    d.database.reset();
+    Sqlite(d.path, 0).execute("DROP TABLE common; DROP TABLE conflicts; PRAGMA user_version=3");
+    d.database = d.open("rolvane");
+    const UniqueId ada("A:CXPerson");
+    EXPECT_FALSE(d->commonVersion(ada)) << "nobody knows what stores have had";
+    d->setCommonVersion(ada, d->personRow(ada)->encoded);
+    d->save();
+    d->recordForUniqueId(ada)->setValue(Value("Adele"), kCXFirstNameProperty);
+    d->save();
+    EXPECT_EQ(d->editedSinceCommon(), std::vector{ada});
+    d.database.reset();
+    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 4);
 }
 
 TEST(DatabaseFault, AnotherProgramsFileIsRefusedAndLeftAlone) {
