@@ -112,6 +112,11 @@ CXDChangeRecords CXDCXConduit::changeRecords() {
     rolvane().forEachPersonModifiedSince(since, kCXSubscribedPersonTable, [&](const CXRow& person) {
         if (person.writer != ownProgram()) capture.addPerson(person, true);
     });
+    // Edits that were captured once and are not sent: the queue has them, or has lost them to its own rules.
+    for (const UniqueId& edited : rolvane().editedSinceCommon()) {
+        const auto person = rolvane().personRow(edited);
+        if (person && (person->modified <= since || person->writer == ownProgram())) capture.addPerson(*person, true);
+    }
     for (const CXSubscriptionRef& subscription : rolvane().subscriptions())
         if (subscription->_isAll() && saysSomething(*subscription))
             capture.addGroup(rolvane().allGroupForRemoteLocation(subscription->remoteLocation()));

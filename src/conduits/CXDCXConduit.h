@@ -144,6 +144,7 @@ private:
     std::shared_ptr<CXPerson> personOf(const CXDChangeRecord& record);
     std::shared_ptr<CXGroup> groupOf(const CXDChangeRecord& record);
     std::shared_ptr<CXGroup> subgroupOf(const CXDChangeRecord& record);
+    void takeIn(const CXDChangeRecord& record, CXPerson& person, const Dictionary& content);
     bool mayChange(const CXDChangeRecord& record, const CXRecord& found);
     // Has somebody else saved the record since this pass gathered its changes? That edit is still to be captured.
     bool hasUncapturedEdit(const UniqueId& uid);

@@ -2,9 +2,10 @@
 
 #include "acl/CXDCXACLManager.h"
 #include "conduits/CXDCXConduit.h"
-#include "contacts/CXMerger.h"
+#include "conduits/ContactWrites.h"
 #include "contacts/CXRolvane.h"
 #include "contacts/Constants.h"
+#include "contacts/ContactMerge.h"
 #include "contacts/Identifier.h"
 #include "foundation/Log.h"
 #include "foundation/PropertyList.h"
@@ -176,12 +177,38 @@ bool CXDCXConduit::updateRecord(const CXDChangeRecordPtr& record) {
         person = CXPerson::initWithUniqueId(uid);
         rolvane().addRecord(person);
     }
-    // Saved while this pass runs, and told to nobody yet: as with two changes that meet in the queue, nothing of either
-    // is lost, and the edit is delivered after the pass.
-    if (hasUncapturedEdit(person->uniqueId())) content = CXMerger::merged(content, person->dictionaryRepresentation());
-    person->resetWithDictionary(content, true, false);
+    takeIn(*record, *person, content);
     _written.insert(uid);
     return true;
+}
+
+// An edit that was not sent meets a version of somebody else's: nothing of either is lost. The edit waits in the queue,
+// is delivered after the pass, or is found by the next scan.
+void CXDCXConduit::takeIn(const CXDChangeRecord& record, CXPerson& person, const Dictionary& content) {
+    const auto common = rolvane().commonVersion(person.uniqueId());
+    const bool hasEdit = common ? common->properties != nullptr : hasUncapturedEdit(person.uniqueId());
+    if (!hasEdit) {
+        person.resetWithDictionary(content, true, false);
+        rolvane().setCommonVersion(person.uniqueId(), person.encodedRepresentation());
+        return;
+    }
+    const Dictionary ours = person.dictionaryRepresentation();
+    std::optional<Dictionary> base;
+    if (common) base = cxAsSent(BinaryValue::decode(*common->properties).dictionary());
+    person.resetWithDictionary(content, true, false); // what is not known goes
+    const auto theirs = person.encodedRepresentation();
+    const Dictionary there = BinaryValue::decode(*theirs).dictionary(), here = cxAsSent(ours);
+    CXMergeResult merge = mergedContact(base, here, there, CXSide::ours);
+    if (!merge.conflicts.empty()) {
+        CXDConduit* source = engine().conduitForSyncSource(record.initialSource());
+        const auto edited = common ? common->edited : std::optional(rolvane().personRow(person.uniqueId())->modified);
+        const auto written = source ? source->dateOfContact(record) : std::nullopt;
+        merge = mergedContact(base, here, there, laterSide(edited, written, here, there));
+    }
+    if (const Value& place = there[kCXRemoteLocationProperty]) merge.contact.set(kCXRemoteLocationProperty, place);
+    rolvane().noteConflicts(person.uniqueId(), merge.conflicts);
+    person.resetWithDictionary(merge.contact, true, false);
+    rolvane().setCommonVersion(person.uniqueId(), theirs);
 }
 
 bool CXDCXConduit::deleteRecord(const CXDChangeRecordPtr& record) {

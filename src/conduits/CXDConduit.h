@@ -92,6 +92,12 @@ public:
     // nothing.
     virtual void wasRefused(const CXDChangeRecord& /*record*/) {}
 
+    // Contacts that an apply has merged with a version of somebody else's: as updates for the contact database, since
+    // the last call. Base: none.
+    virtual CXDChangeRecords takeMerged() { return {}; }
+    // When the record's contact was put where this source keeps it, by that place's clock. Base: not known.
+    virtual std::optional<Date> dateOfContact(const CXDChangeRecord& /*record*/) { return std::nullopt; }
+
     // True: this source is done with the record (applied, cancelled, or of a revoked location). An exception of the
     // base class costs one false and two log lines.
     bool applyChangeRecordIfNeeded(const CXDChangeRecordPtr& record, bool* denied);

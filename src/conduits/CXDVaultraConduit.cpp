@@ -8,6 +8,7 @@
 #include "conduits/UserAlert.h"
 #include "contacts/CXRolvane.h"
 #include "contacts/Constants.h"
+#include "contacts/Identifier.h"
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
 #include "foundation/Preferences.h"
@@ -162,6 +163,9 @@ void CXDVaultraConduit::open() {
     if (_serverDate.valid()) _serverDate.wait(); // of a pass that failed
     _serverDate = {};
     _world.manager.expectNothing();
+    _writes.giveUpMerged(); // of a pass that failed
+    _setBack.clear();
+    _publishesAgain = !engine().conduitObjectForKey(kConduitCX, kPublishAgain).empty();
     const int code = testReachability(gathering ? [this] { beginReading(); } : std::function<void()>());
     if (code == kCXDAVErrorAuthentication) {
         if (shouldWarnUserAboutUserNameOrPassword()) {
@@ -272,7 +276,10 @@ bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state)
     CXLog("The tree of %@ %@. %@", isOwn ? *realUserFromUser(user) : user, condition.sentence,
           isOwn ? "It is published again." : "It is left alone until its owner has mended it.");
     if (condition.kind == TreeCondition::Kind::setBack) prior.set(kTreeDates, datesToWaitFor(state));
-    if (!isOwn) return false;
+    if (!isOwn) {
+        _setBack.insert(user);
+        return false;
+    }
     const bool isRefused = !engine().conduitObjectForKey(kConduitCX, kRefusedByStore).empty();
     if (condition.kind == TreeCondition::Kind::lostAGroup && isRefused) return false; // it could not be written yet
     if (condition.mayPass() && !looked)
@@ -339,6 +346,7 @@ bool CXDVaultraConduit::allGroupHas(const char* property) {
 
 CXDChangeRecords CXDVaultraConduit::changeRecords() {
     CXDChangeRecords records = CXDConduit::changeRecords();
+    _publishesAgain = !engine().conduitObjectForKey(kConduitCX, kPublishAgain).empty();
     leaveUnlistedOut(records);
     _read.clear();
     records.insert(records.end(), _leftovers.begin(), _leftovers.end());
@@ -424,8 +432,16 @@ bool CXDVaultraConduit::applyChangeRecord(const CXDChangeRecordPtr& record, bool
 void CXDVaultraConduit::wasRefused(const CXDChangeRecord& record) {
     const bool isContact = record.type() == CXDUpdateRecord || record.type() == CXDDeleteRecord;
     const auto base = baseLocationOf(record);
+    const bool isEdit = record.type() == CXDUpdateRecord && record.initialSource() == CXDSyncSourceCX;
+    if (isEdit && record.person() && !record.changeMadeByDataOwner()) forgetEdit(record);
     if (isContact && base && record.person())
-        _world.manager.forgetVersion(layout::contactLocation(*base, *record.person()));
+        _world.manager.forgetVersion(layout::contactLocation(*base, cxNormalizedUID(*record.person())));
+}
+
+// What the store holds is not to be merged with an edit that it will never take.
+void CXDVaultraConduit::forgetEdit(const CXDChangeRecord& record) {
+    const UniqueId uid = inDatabase(record);
+    if (const auto row = _world.rolvane.personRow(uid)) _world.rolvane.setCommonVersion(uid, row->encoded);
 }
 
 // Identifiers also come out of other people's lists: one that names the tree's own files would destroy those. What has
@@ -437,6 +453,7 @@ bool CXDVaultraConduit::mayBeNamed(const CXDChangeRecordPtr& record) {
               "stays in this database: %@",
               *name, record->description());
         engine().noteRefused({record->user().value_or(UserName()), kRefusedForItsName});
+        if (record->type() == CXDUpdateRecord && record->person()) forgetEdit(*record);
         return false;
     }
     return true;
@@ -461,8 +478,45 @@ bool CXDVaultraConduit::apply(CXDChangeRecord& record, int& code) {
 bool CXDVaultraConduit::updateRecord(CXDChangeRecord& record, int& code) {
     const auto base = baseLocationOf(record);
     if (!base || !record.person()) return false;
-    return _world.manager.write(stringForDictionary(contentOf(record)),
-                                layout::contactLocation(*base, *record.person()), kSecureRecordWrites, &code);
+    const UserName user = record.user().value_or(UserName());
+    const ContactWrites::Place place{user, layout::contactLocation(*base, *record.person()), inDatabase(record),
+                                     mergesInto(user)};
+    return _writes.write(place, contentOf(record), code);
+}
+
+// A shared identifier means the owner's own contact in the own tree, and in another one the copy that came from there.
+UniqueId CXDVaultraConduit::inDatabase(const CXDChangeRecord& record) {
+    const UniqueId own = cxUIDWithTableName(*record.person(), kCXPersonTable);
+    if (record.changeMadeByDataOwner()) return own;
+    UniqueId copy = cxUIDWithTableName(own, kCXSubscribedPersonTable);
+    return _world.rolvane.personRow(copy) ? copy : own;
+}
+
+// Where nobody else writes there is nothing to merge with. What an older copy of a tree holds is no news.
+bool CXDVaultraConduit::mergesInto(const UserName& user) {
+    if (user == kSelf) return _isWrittenByOthers && !_publishesAgain;
+    return !_setBack.contains(user);
+}
+
+CXDChangeRecords CXDVaultraConduit::takeMerged() {
+    CXDChangeRecords updates;
+    for (const ContactWrites::Merged& merged : _writes.takeMerged()) {
+        Dictionary content = merged.contact.mutableCopy();
+        const auto base = baseLocationForUser(realUserFromUser(merged.place.user));
+        if (merged.place.user != kSelf && base)
+            stampWithRemoteLocation(content, RemoteLocation(base->absoluteString()));
+        auto update = std::make_shared<CXDChangeRecord>(conduitSource(), CXDUpdateRecord, merged.place.user,
+                                                        merged.place.uniqueId, std::nullopt, std::move(content));
+        update->setAppliesToSources(CXDSyncSourceCX);
+        updates.push_back(std::move(update));
+    }
+    return updates;
+}
+
+std::optional<Date> CXDVaultraConduit::dateOfContact(const CXDChangeRecord& record) {
+    const auto base = baseLocationOf(record);
+    if (_vaultraOffLine || !base || !record.person()) return std::nullopt;
+    return _world.manager.modDateForURL(layout::contactLocation(*base, cxNormalizedUID(*record.person())));
 }
 
 bool CXDVaultraConduit::createStructureForGroup(CXDChangeRecord& record, int& code) {

@@ -1,6 +1,7 @@
 #pragma once
 
 #include "conduits/CXDConduit.h"
+#include "conduits/ContactWrites.h"
 #include "foundation/Notification.h"
 
 #include <atomic>
@@ -9,6 +10,7 @@
 #include <map>
 #include <memory>
 #include <mutex>
+#include <set>
 #include <string>
 #include <unordered_map>
 
@@ -68,6 +70,8 @@ public:
     using CXDConduit::applyChangeRecord;
     bool applyChangeRecord(const CXDChangeRecordPtr& record, bool* denied) override;
     void wasRefused(const CXDChangeRecord& record) override;
+    CXDChangeRecords takeMerged() override;
+    std::optional<Date> dateOfContact(const CXDChangeRecord& record) override;
     void willGather() override { _gathering = true; }
     // A refused user name or password warns the person, at most once in 15 minutes, and ends the daemon. In a
     // gathering the structure of a tree of which nothing is known is looked after while the pass goes on; what needs it
@@ -133,6 +137,9 @@ private:
     // Each writes one kind of change and sets the result code to the last request's HTTP status.
     bool apply(CXDChangeRecord& record, int& code);
     bool updateRecord(CXDChangeRecord& record, int& code);
+    UniqueId inDatabase(const CXDChangeRecord& record);
+    void forgetEdit(const CXDChangeRecord& record);
+    bool mergesInto(const UserName& user);
     bool createStructureForGroup(CXDChangeRecord& record, int& code);
     bool makeCompositeGroupChange(CXDChangeRecord& record, int& code);
     bool wasDeletedThere(CXDChangeRecord& record);
@@ -145,8 +152,11 @@ private:
     bool changeGroupReadWriteACL(CXDChangeRecord& record);
 
     World _world;
+    ContactWrites _writes{_world.manager, _world.rolvane};
     std::atomic<bool> _vaultraOffLine = false;
     std::atomic<bool> _isWrittenByOthers = false; // the own tree, as of the last open
+    std::atomic<bool> _publishesAgain = false;    // the own tree: it is older than the database
+    std::set<UserName> _setBack;                  // other trees that are, as this pass has seen; main thread
     CXDChangeRecords _leftovers;                  // of the gathering that is under way
     std::map<UserName, Dictionary> _read;         // so far: the states of known users
     bool _gathering = false;                      // `open` belongs to a gathering

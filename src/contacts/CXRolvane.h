@@ -144,8 +144,8 @@ public:
 
     // Two people's edits of one contact ------------------------------------------------------------------------------
     // From the first edit of a contact that a store has had, until that edit is sent, the database keeps the contact as
-    // both had it (contacts/ContactMerge.h merges against that). An edit is every save but one that says itself what both
-    // have.
+    // both had it (contacts/ContactMerge.h merges against that). An edit is every save but one that says itself what
+    // both have.
     //
     // Nothing: no store is known to have had the contact.
     std::optional<CXCommonVersion> commonVersion(const UniqueId& uid);

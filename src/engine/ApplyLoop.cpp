@@ -246,6 +246,7 @@ void ApplyLoop::applyOutOfOrder() {
     _outOfOrder->wait();
     _processedCount += _outOfOrder->processedCount();
     noteRefused(); // before anything of this pass is saved
+    takeInMerged();
 }
 
 void ApplyLoop::noteRefused() {
@@ -253,6 +254,14 @@ void ApplyLoop::noteRefused() {
     _parts.state.withConduitData([&](Dictionary& data) {
         noteRefusedChanges(data, _parts.denied.all(), _parts.denied.refused(), _parts.with.clock.now());
     });
+}
+
+// What was merged on its way to the store is taken into the database as if it had come from there.
+void ApplyLoop::takeInMerged() {
+    CXDConduit& cx = *_parts.conduits.cx;
+    for (const CXDChangeRecordPtr& update : _parts.conduits.vaultra->takeMerged())
+        if (cx.swallows(*update) || !cx.applyChangeRecordIfNeeded(update, nullptr))
+            _parts.conduits.vaultra->wasRefused(*update); // to be read again
 }
 
 void ApplyLoop::applyInOrder() {
@@ -266,6 +275,7 @@ void ApplyLoop::applyInOrder() {
         ++_processedCount;
         _parts.with.progress.didProcessChangeRecord(record);
     }
+    takeInMerged();
 }
 
 // A version of a contact that has come while our own one could not be written: taken in now, it would stand here while

@@ -49,6 +49,7 @@ private:
     void noteUnderWay();
     void applyOutOfOrder();
     void noteRefused();
+    void takeInMerged();
     void applyInOrder();
     void applyInOrder(const CXDChangeRecordPtr& record);
     void noteArrivals();

@@ -192,6 +192,16 @@ std::optional<Dictionary> CXDAVManager::dictionaryAtURL(const Url& url, bool sec
     return std::move(reading.dictionary);
 }
 
+CXDAVManager::Version CXDAVManager::readVersion(const Url& url, bool securely, int* code) {
+    auto reading = _impl->files.read(url, securely);
+    setCode(code, reading.code);
+    return {std::move(reading.dictionary), reading.isKnown, reading.lastModified, reading.failed};
+}
+
+bool CXDAVManager::remembersVersion(const Url& url) const {
+    return _impl->versions.remembers(url.absoluteString());
+}
+
 std::optional<Dictionary> CXDAVManager::dictionaryAtURL(const Url& url, int* errorCode, bool securely) {
     return dictionaryAtURL(url, securely, errorCode);
 }

@@ -93,6 +93,15 @@ public:
     bool write(const std::string& text, const Url& url, bool securely, int* code);
     std::optional<Date> modDateForURL(const Url& url); // the server's, to the second
     std::optional<Dictionary> dictionaryAtURL(const Url& url, bool securely, int* code);
+    // The same, with what is known of the version.
+    struct Version {
+        std::optional<Dictionary> contact; // none: absent, failed, or no dictionary
+        bool isKnown = false;              // it is the version that this client read or wrote last before
+        std::optional<Date> lastModified;  // by the server's clock, to the second
+        bool failed = false;               // whether anything is there was not learnt
+    };
+    Version readVersion(const Url& url, bool securely, int* code);
+    bool remembersVersion(const Url& url) const; // some version of the file, read or written at any time
     std::optional<Dictionary> dictionaryAtURL(const Url& url, int* errorCode, bool securely) override;
     bool removeFileAtURL(const Url& url, int* code); // a file or a collection with its contents; absence: 404, true
     bool removeDirectoryAndContentsAtURL(const Url& url) override;

@@ -245,14 +245,17 @@ void StoreFiles::note(const Url& name, const Url& target, const Fetched& fetched
 StoreFiles::Reading StoreFiles::read(const Url& name, bool securely) {
     lastReads.erase(_reader);
     if (mayBeBoth(name))
-        if (auto unchanged = _copies.unchanged(name.absoluteString())) return {kOk, std::move(unchanged)};
+        if (auto unchanged = _copies.unchanged(name.absoluteString()))
+            return {kOk, std::move(unchanged), true, {}, false};
     const auto url = _session.endpoint(name, securely);
-    if (!url) return {};
+    if (!url) return {.failed = true};
     Url target = *url;
     Fetched fetched = mayBeBoth(name) ? fetchEither(*url, target) : fetch(*url, false);
     if (fetched.found == Found::noDictionary) fetched = confirmed(fetched, target);
+    const bool isKnown = fetched.found == Found::dictionary && _versions.knows(name.absoluteString(), fetched.version);
     note(name, target, fetched);
-    return {fetched.code, std::move(fetched.dictionary)};
+    const bool failed = fetched.found == Found::failed || fetched.found == Found::perhapsCollection;
+    return {fetched.code, std::move(fetched.dictionary), isKnown, fetched.version.lastModified, failed};
 }
 
 void StoreFiles::expectReads(const std::vector<Url>& names, bool securely) {

@@ -28,6 +28,9 @@ public:
     struct Reading {
         int code = 0;
         std::optional<Dictionary> dictionary;
+        bool isKnown = false;             // the version is the one that this client read or wrote last
+        std::optional<Date> lastModified; // by the server's clock
+        bool failed = false;              // what is there, or whether anything is, was not learnt
     };
     Reading read(const Url& name, bool securely);
     // These are going to be read, in this order (see ReadAhead).

@@ -173,6 +173,11 @@ bool VersionMemory::knows(std::string_view url, const FileVersion& v) {
     return true;
 }
 
+bool VersionMemory::remembers(std::string_view url) const {
+    std::lock_guard guard(_mutex);
+    return _entries.contains(hash(url));
+}
+
 size_t VersionMemory::count() const {
     std::lock_guard guard(_mutex);
     return _entries.size();

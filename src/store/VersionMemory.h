@@ -37,6 +37,8 @@ public:
     // True when the version in a listing is the one remembered.
     bool knows(std::string_view url, const FileVersion& version);
 
+    bool remembers(std::string_view url) const; // some version of it
+
     void save(); // nothing when unchanged; a failure is logged
     size_t count() const;
 

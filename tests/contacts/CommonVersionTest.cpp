@@ -5,7 +5,7 @@
 
 #include <gtest/gtest.h>
 
-namespace rolvane {
+namespace rolvane::test {
 namespace {
 
 class CommonVersion : public testing::Test {
@@ -103,4 +103,4 @@ TEST_F(CommonVersion, ConflictsAreNotedOnceAndForgottenByNumber) {
 }
 
 } // namespace
-} // namespace rolvane
+} // namespace rolvane::test

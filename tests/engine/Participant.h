@@ -41,7 +41,8 @@ private:
 };
 
 struct AlwaysReachable : CXNetworkController {
-    bool canReachAddress(const std::string&) override { return true; }
+    bool canReachAddress(const std::string&) override { return reachable; }
+    bool reachable = true; // unless a test says otherwise
 };
 
 struct Told : UserAlert {

@@ -1,0 +1,64 @@
+#pragma once
+
+#include "contacts/CXRolvane.h"
+#include "foundation/Url.h"
+#include "foundation/Value.h"
+#include "model/CXDChangeRecord.h"
+
+#include <functional>
+#include <mutex>
+#include <optional>
+#include <vector>
+
+namespace rolvane {
+
+class CXDAVManager;
+
+// The contact as it comes back from a store: dates to the second, for instance.
+Dictionary cxAsSent(const Dictionary& contact);
+
+// Writes edited contacts into trees that others write to, too. A version that the client does not know is merged with
+// the own one (contacts/ContactMerge.h) before it is written over, and only the version that was read is written over.
+//
+// Steps of one write, and what a process that is killed behind each of them leaves:
+//   read the store's version    nothing
+//   note the conflicts          the note, which is not made twice
+//   write the merged contact    the edit still waits; merged again with its own result it gives that result
+//   tell the database           the common version is as old as before: the same
+// Any thread.
+class ContactWrites {
+public:
+    // Both borrowed.
+    ContactWrites(CXDAVManager& manager, CXRolvane& rolvane) : _manager(manager), _rolvane(rolvane) {}
+
+    struct Place {
+        UserName user;     // of the tree
+        Url location;      // of the contact's file
+        UniqueId uniqueId; // of the contact in the database
+        bool merges;       // others may have written there, and what they wrote may be taken in here
+    };
+    // True when the store has the content afterwards, alone or merged. `code`: the last answer's status; 412 when
+    // somebody else was faster several times.
+    bool write(const Place& place, const Dictionary& ours, int& code);
+
+    // What was merged and is to be taken into the database: its contents, since the last call.
+    struct Merged {
+        Place place;
+        Dictionary contact;
+    };
+    std::vector<Merged> takeMerged();
+    // What nobody has taken counts as not seen yet.
+    void giveUpMerged();
+
+private:
+    bool put(const Place& place, const Dictionary& content, int& code);
+    bool writeMerged(const Place& place, const Dictionary& ours, const Dictionary& theirs,
+                     const std::optional<Date>& theirDate, int& code);
+
+    CXDAVManager& _manager;
+    CXRolvane& _rolvane;
+    std::mutex _lock;
+    std::vector<Merged> _merged; // guarded by _lock
+};
+
+} // namespace rolvane
