@@ -1,3 +1,4 @@
+#include "Conflicts.h"
 #include "Context.h"
 #include "Counted.h"
 #include "FailureText.h"
@@ -166,6 +167,7 @@ Json status(Context& context) {
             {"subscriptions", subscriptions},
             {"withdrawn", withdrawnJson()},
             {"refused", refusedJson(preferences)},
+            {"conflicts", conflictsJson(database)},
             {"pending", waitingIn(outcome)},
             {"notLookedAt", shares ? editsNotLookedAt(database) : 0},
             {"lastPass", outcome ? Json(outcome->ended.toISO8601()) : Json()},
@@ -228,6 +230,9 @@ void showStatus(Context& context) {
     row("Subscribed", subscribedText(s["subscriptions"]));
     for (const Json& record : s["withdrawn"]) row("Withdrawn", withdrawnText(record));
     for (const Json& record : s["refused"]) row("Refused", refusedText(record));
+    for (const Json& conflict : s["conflicts"])
+        row("Conflict", fmt::format("{}; `rolvane conflicts restore {}` puts it back", conflictText(conflict),
+                                    conflict["number"].get<int64_t>()));
     row("Waiting", counted(pending, "change", "changes"));
     if (const size_t edited = s["notLookedAt"]; edited > 0)
         row("", fmt::format("{} edited since the daemon looked last{}", counted(edited, "record was", "records were"),

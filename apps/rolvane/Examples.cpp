@@ -43,6 +43,8 @@ const std::map<std::string, const char*>& examples() {
         {"rights", "  rolvane rights bob"},
         {"withdrawn list", "  rolvane withdrawn list"},
         {"withdrawn import", "  rolvane withdrawn import bob"},
+        {"conflicts list", "  rolvane conflicts list"},
+        {"conflicts restore", "  rolvane conflicts restore 3"},
         {"subscribe", "  rolvane subscribe bob\n"
                       "  rolvane subscribe http://dav.example.org/bob/Contacts --no-wait"},
         {"unsubscribe", "  rolvane unsubscribe bob"},

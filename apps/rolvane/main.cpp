@@ -82,6 +82,7 @@ int main(int argc, char** argv) {
     addShareCommands(app, context);
     addSubscriptionCommands(app, context);
     addWithdrawnCommands(app, context);
+    addConflictCommands(app, context);
     addDaemonCommands(app, context);
     addPreferencesCommands(app, context);
     addStoreCommands(app, context);
