@@ -59,7 +59,10 @@ void CXRolvane::recoverShareCount(Preferences& preferences) {
 
 std::optional<CXCommonVersion> CXRolvane::commonVersion(const UniqueId& uid) {
     std::lock_guard lock(_impl->mutex);
-    std::optional<CXCommonVersion> stored = _impl->commonVersions.of(uid);
+    const PendingRecord* pending = _impl->work.find(uid);
+    const bool isAnother = pending && (pending->deleted || pending->isInsertion()); // than the one that is stored
+    std::optional<CXCommonVersion> stored;
+    if (!isAnother) stored = _impl->commonVersions.of(uid);
     const auto& unsaved = _impl->work.commonVersions();
     const auto found = unsaved.find(uid);
     if (found == unsaved.end()) return stored;

@@ -99,6 +99,7 @@ void UnitOfWork::remove(const UniqueId& uid, RecordKind kind, bool inStore, Date
         bool drop = at->first == uid || at->second.empty();
         at = drop ? _memberships.erase(at) : std::next(at);
     }
+    _commonVersions.erase(uid);
     PendingRecord& record = touch(uid, kind, inStore, now);
     if (record.whole) _size -= record.whole->size();
     record.whole.reset();

@@ -73,6 +73,16 @@ TEST_F(CommonVersion, GoesWithItsContactAndIsOfNoOtherOne) {
     EXPECT_TRUE(d->editedSinceCommon().empty());
 }
 
+TEST_F(CommonVersion, IsNotThatOfAnotherContactWhichHadTheIdentifierBefore) {
+    edit(*d.database, kCXNoteProperty, "one");
+    d->setCommonVersion(ada, d->personRow(ada)->encoded);
+    d->removeRecord(d->recordForUniqueId(ada));
+    d.addPerson("Another", ada.str());
+    EXPECT_FALSE(d->commonVersion(ada)) << "before it is saved";
+    d->save();
+    EXPECT_FALSE(d->commonVersion(ada));
+}
+
 TEST_F(CommonVersion, AnEditDuringAReplacementIsMergedByValueAndWhatGaveWayIsNoted) {
     const auto other = d.open("rolvane");
     const auto person = std::dynamic_pointer_cast<CXPerson>(d->recordForUniqueId(ada));
