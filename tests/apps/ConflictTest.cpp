@@ -27,8 +27,8 @@ protected:
             bob->done({"sync"});
         }
     }
-    static std::string propertyOf(const nlohmann::json& people, const char* property) {
-        const auto& properties = people.at(0).at("properties");
+    static std::string propertyOf(const nlohmann::json& person, const char* property) {
+        const auto& properties = person.at("properties");
         return properties.contains(property) ? properties.at(property).get<std::string>() : "nothing";
     }
     void expectOnBoth(const char* property, const std::string& value) {
