@@ -92,7 +92,8 @@ void AbsenceCheck::requireItsLocation(const UniqueId& uid) {
 void AbsenceCheck::requireUnlisted(const UniqueId& group, const std::vector<UniqueId>& members) {
     CXRolvane::Impl& d = _rolvane.impl();
     std::lock_guard lock(d.mutex);
-    if (members.empty() || d.work.changesMemberships()) return;
+    // Of what is not saved the rows say nothing yet. Who tells others what has changed has saved before.
+    if (members.empty() || !d.work.empty()) return;
     for (const UniqueId& member : members)
         if (d.store.rowNumber(member) == 0 && d.store.rowNumber(otherFormOf(member)) == 0) requireGone(member);
     if (const auto member = d.store.firstListedAfterAll(group, members))

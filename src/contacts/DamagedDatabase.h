@@ -36,7 +36,7 @@ public:
     void requireGoneFrom(std::string_view location, const UniqueId& uid);
     // The record stands under the location that its properties name: whoever is looked for there is of that location.
     void requireItsLocation(const UniqueId& uid);
-    // The group does not list any of them: identifiers as in the database.
+    // The group does not list any of them: identifiers as in the database. Not asked while anything is unsaved.
     void requireUnlisted(const UniqueId& group, const std::vector<UniqueId>& members);
 
 private:
