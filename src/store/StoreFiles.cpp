@@ -248,7 +248,7 @@ StoreFiles::Reading StoreFiles::read(const Url& name, bool securely) {
         if (auto unchanged = _copies.unchanged(name.absoluteString()))
             return {kOk, std::move(unchanged), true, {}, false};
     const auto url = _session.endpoint(name, securely);
-    if (!url) return {.failed = true};
+    if (!url) return {0, std::nullopt, false, std::nullopt, true};
     Url target = *url;
     Fetched fetched = mayBeBoth(name) ? fetchEither(*url, target) : fetch(*url, false);
     if (fetched.found == Found::noDictionary) fetched = confirmed(fetched, target);
