@@ -16,6 +16,7 @@
 #include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
+#include <vector>
 
 #include <gtest/gtest.h>
 
@@ -278,16 +279,17 @@ TEST_F(Ends, ItsFileIsThePersonsAlone) {
     EXPECT_EQ(info.st_mode & 07777, 0700U);
 }
 
-TEST_F(Ends, AnotherUserIsLetGoWithoutAnAnswer) {
-    if (::geteuid() != 0) GTEST_SKIP() << "only root can be another user for a moment";
+// Only root can be another user for a moment, so there are tests of it where root runs them.
+class EndsAndAStranger : public Ends, public testing::WithParamInterface<uid_t> {};
+
+TEST_P(EndsAndAStranger, AnotherUserIsLetGoWithoutAnAnswer) {
     start();
     ASSERT_EQ(::chmod(path.c_str(), 0666), 0);
     for (const std::string& way : {home.path(), home / "runtime"}) ASSERT_EQ(::chmod(way.c_str(), 0755), 0);
     auto asked = listen(*daemon, "Ask");
     const pid_t stranger = ::fork();
     if (stranger == 0) {
-        constexpr uid_t kNobody = 65534;
-        if (::setresuid(kNobody, kNobody, kNobody) != 0) std::_Exit(9);
+        if (::setresuid(GetParam(), GetParam(), GetParam()) != 0) std::_Exit(9);
         if (connectToPath(path)) std::_Exit(1); // somebody else's daemon is none for this one
         sockaddr_un address{};
         address.sun_family = AF_UNIX;
@@ -305,6 +307,11 @@ TEST_F(Ends, AnotherUserIsLetGoWithoutAnAnswer) {
     for (int i = 0; i < 20; ++i) loop.runOnce(0.005);
     EXPECT_TRUE(heard.empty());
 }
+
+constexpr uid_t kNobody = 65534;
+GTEST_ALLOW_UNINSTANTIATED_PARAMETERIZED_TEST(EndsAndAStranger);
+INSTANTIATE_TEST_SUITE_P(Whom, EndsAndAStranger,
+                         testing::ValuesIn(::geteuid() == 0 ? std::vector{kNobody} : std::vector<uid_t>()));
 
 TEST_F(Ends, APathThatIsTooLongForAnAddressServesAsWell) {
     path = home / "runtime/" + std::string(120, 'd');
