@@ -55,10 +55,10 @@ struct DamagedDatabase : TestDatabase {
     }
     void reopenDatabase() { database = open(); }
     std::vector<std::string> everybody() {
-        std::vector<std::string> all;
-        for (const UniqueId& uid : database->allGroup()->memberUniqueIds()) all.push_back(uid.str());
-        std::sort(all.begin(), all.end());
-        return all;
+        std::vector<std::string> members;
+        for (const UniqueId& uid : database->allGroup()->memberUniqueIds()) members.push_back(uid.str());
+        std::sort(members.begin(), members.end());
+        return members;
     }
     CXGroupRef group(const std::string& uid) {
         return std::dynamic_pointer_cast<CXGroup>(database->recordForUniqueId(UniqueId(uid)));

@@ -25,7 +25,9 @@ struct TemporaryFiles : testing::Test {
         const std::string path = directory / name;
         std::ofstream(path) << "half of it";
         const timespec times[2] = {{1'700'000'000, 0}, {1'700'000'000, 0}};
-        if (old) EXPECT_EQ(::utimensat(AT_FDCWD, path.c_str(), times, 0), 0);
+        if (old) {
+            EXPECT_EQ(::utimensat(AT_FDCWD, path.c_str(), times, 0), 0);
+        }
         return path;
     }
     bool isThere(const std::string& path) { return std::filesystem::exists(path); }
