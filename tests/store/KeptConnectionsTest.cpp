@@ -88,7 +88,9 @@ TEST(KeptConnections, ARequestThatMeetsOnlyConnectionsThatWereClosedGoesOutOnANe
         });
         const HttpResponse answer = kept.transport.perform(asking(kept.server.origin(), method));
         EXPECT_EQ(answer.status, 200) << method << ": " << answer.detail;
-        if (method == "PUT") EXPECT_EQ(answer.body, "the body");
+        if (method == "PUT") {
+            EXPECT_EQ(answer.body, "the body");
+        }
         EXPECT_EQ(kept.server.connections(), kConnections + 1) << method;
     }
 }
