@@ -499,8 +499,9 @@ TEST_F(VaultraConduit, AGroupsStateThatCameToHarmIsWrittenAnewFromWhatItHeldLast
 
     std::filesystem::remove(world->file("G:CXGroup"));
     EXPECT_TRUE(apply(record(CXDCompositeGroupChange, nullptr, "G:CXGroup", adds)));
-    EXPECT_EQ(client->read("G:CXGroup").second.value_or(Dictionary())["memberUIDState"], Value(Array{"c"}))
-        << "what is missing is begun anew";
+    const Dictionary anew = client->read("G:CXGroup").second.value_or(Dictionary());
+    EXPECT_EQ(anew["memberUIDState"], Value(Array{"a", "b", "c"})) << "a list of the change alone would be a lost one";
+    EXPECT_EQ(anew[kCXGroupNameProperty], Value("F"));
 }
 
 TEST_F(VaultraConduit, AGroupThatSomebodyElseChangedMeanwhileIsTriedAgainLater) {

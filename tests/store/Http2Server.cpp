@@ -1,6 +1,7 @@
 #include "Http2Server.h"
 
 #include <arpa/inet.h>
+#include <csignal>
 #include <cstdio>
 #include <openssl/evp.h>
 #include <openssl/pem.h>
@@ -73,6 +74,7 @@ void Http2Server::Connection::sendGoAway(uint32_t lastStream, Error error) const
 Http2Server::Http2Server(const std::string& caFile, Script script)
     : _script(std::move(script)), _context(SSL_CTX_new(TLS_server_method()), &SSL_CTX_free),
       _listener(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
+    ::signal(SIGPIPE, SIG_IGN); // a client that has gone ends no test
     certify(caFile);
     SSL_CTX_set_alpn_select_cb(
         _context.get(),
