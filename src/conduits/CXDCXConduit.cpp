@@ -83,7 +83,10 @@ void CXDCXConduit::close() {
     _lastSyncDate = _world.clock.now();
     _world.preferences.set(kDaemonDomain, kLastSyncDateKey, *_lastSyncDate);
     _world.preferences.synchronize(kDaemonDomain);
-    if (_scan) rolvane().advanceCursorTo(_scan->journalPosition, _scan->since);
+    if (_scan) {
+        rolvane().advanceCursorTo(_scan->journalPosition, _scan->since);
+        _lastScan = _scan->journalPosition;
+    }
     _scan.reset();
     _captured = 0;
     _written.clear();
@@ -112,8 +115,14 @@ CXDChangeRecords CXDCXConduit::changeRecords() {
     rolvane().forEachPersonModifiedSince(since, kCXSubscribedPersonTable, [&](const CXRow& person) {
         if (person.writer != ownProgram()) capture.addPerson(person, true);
     });
-    // Edits that were captured once and are not sent: the queue has them, or has lost them to its own rules.
+    // Edits that were captured once and are not sent: the queue has them, or has lost them to its own rules. The
+    // journal still delivers those that were saved while the last pass ran.
+    std::unordered_set<UniqueId> delivered;
+    if (_lastScan != 0)
+        for (const UniqueId& changed : rolvane().changedByOthers(_lastScan, scan.journalPosition))
+            delivered.insert(changed);
     for (const UniqueId& edited : rolvane().editedSinceCommon()) {
+        if (delivered.contains(edited)) continue;
         const auto person = rolvane().personRow(edited);
         if (person && (person->modified <= since || person->writer == ownProgram())) capture.addPerson(*person, true);
     }

@@ -157,9 +157,10 @@ private:
     World _world;
     bool _readOnlyKillSwitch = false;
     std::optional<Scan> _scan;
-    int64_t _captured = 0;                                    // the journal's position when this pass gathered, and
-    int64_t _editsKnown = 0;                                  // the one up to which
-    std::unordered_set<UniqueId> _uncaptured;                 // holds what others have saved since
+    int64_t _lastScan = 0;                    // the journal's position at the scan of the pass before, in this process
+    int64_t _captured = 0;                    // the journal's position when this pass gathered, and
+    int64_t _editsKnown = 0;                  // the one up to which
+    std::unordered_set<UniqueId> _uncaptured; // holds what others have saved since
     std::unordered_map<RemoteLocation, UserName> _publishers; // whose the locations are, as far as asked
     std::unordered_set<UniqueId> _written;                    // people of this pass
     ObservationHandle _databaseChanged;

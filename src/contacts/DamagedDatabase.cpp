@@ -209,9 +209,11 @@ private:
     }
 
     void compareRows() {
-        for (const auto& [id, uid] : _rows)
-            if (std::none_of(_witnesses.begin(), _witnesses.end(), [&](const auto& w) { return knows(w, id, uid); }))
-                unbelievable("no index knows the record " + uid);
+        for (const auto& row : _rows) {
+            const auto known = [&](const Identifiers& witness) { return knows(witness, row.first, row.second); };
+            if (std::none_of(_witnesses.begin(), _witnesses.end(), known))
+                unbelievable("no index knows the record " + row.second);
+        }
         std::map<std::pair<int64_t, std::string>, int> missing;
         for (const Identifiers& witness : _witnesses)
             for (const auto& [id, uid] : witness)

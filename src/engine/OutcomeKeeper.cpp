@@ -103,7 +103,8 @@ PassOutcome OutcomeKeeper::end() {
             _preferences.synchronize(kDaemonDomain);
         }
     } catch (const CXException& e) {
-        CXLog("The outcome of the pass could not be stored: %@", e);
+        // Where the same has ended the pass, it stands in the log already.
+        if (outcome.exception != e.reason()) CXLog("The outcome of the pass could not be stored: %@", e);
         if (!outcome.storage) outcome.storage = e.reason();
     }
     _previous = outcome;

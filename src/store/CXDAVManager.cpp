@@ -62,7 +62,7 @@ StoreFiles::Reading CXDAVManager::Impl::read(const Url& name, bool securely) {
     const Url tree = name.cxURLByDeletingLastComponent();
     const bool isInfo = name.cxLastComponent() == "info" && tree.pathComponents().size() == 3; // "/", user, "Contacts"
     if (!isInfo || !endsATree(once.code)) return once;
-    CXLog("%@ was answered with %d. It is asked once more.", name, once.code);
+    CXDLog("%@ was answered with %d. It is asked once more.", name, once.code);
     if (!session.provesItself()) return {};
     if (tree.absoluteString() + "/" == ownTree) structure.check(true);
     return files.read(name, securely);
