@@ -203,7 +203,7 @@ std::vector<RequestFailure> RequestFailures::take() {
 }
 
 std::optional<RequestFailure> RequestFailures::latestBelow(const Url& baseName) const {
-    const std::string base = baseName.absoluteString();
+    const std::string& base = baseName.absoluteString();
     const auto isBelow = [&base](const Url& name) {
         const std::string& text = name.absoluteString();
         return text.starts_with(base) &&
