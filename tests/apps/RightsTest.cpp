@@ -217,7 +217,7 @@ TEST_F(RightsOnAFailingStore, AWithdrawalThatCouldNotBeSavedIsSavedByTheNextProc
     fails(true);
     world.done({"unshare", "bob", "--no-daemon"});
     world.done({"daemon", "start"});
-    world.done({"sync"});
+    EXPECT_EQ(world.rolvane({"sync"}).status, kNotReached) << "the list waits";
     EXPECT_EQ(bob.json({"rights", "alice"})["write"], true) << "the store does not know yet";
     killTheDaemon();
     fails(false);
