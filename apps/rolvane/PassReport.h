@@ -9,9 +9,9 @@
 
 namespace rolvane::cli {
 
-// What is to be told of a pass. Everything that the commands say of one comes from here.
+// The commands' report of a pass: all that they say about it comes from here.
 struct PassReport {
-    ExitCode code = kOk;            // of what is worst: refused, then not reached, then failed
+    ExitCode code = kOk;            // the worst result counts: refused, then not reached, then failed
     std::vector<std::string> lines; // whole sentences, each for one thing that is not as it should be
 };
 

@@ -53,8 +53,8 @@ public:
     bool empty() const { return _lists.empty(); }
     bool mentionsGroups() const;
 
-    // What each list grants to the caller, by its tree: every entry is looked at once, however many places are asked
-    // about later.
+    // The privileges that each list grants to the caller, by the list's tree. Every entry is looked at once, however
+    // many places are asked about later.
     using Granted = std::map<std::string, unsigned, std::less<>>;
     Granted grantedTo(const Caller& caller) const;
     // What the lists of the places on the way down to the tree grant, together.

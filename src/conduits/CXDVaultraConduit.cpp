@@ -438,7 +438,7 @@ void CXDVaultraConduit::wasRefused(const CXDChangeRecord& record) {
         _world.manager.forgetVersion(layout::contactLocation(*base, cxNormalizedUID(*record.person())));
 }
 
-// What the store holds is not to be merged with an edit that it will never take.
+// The store will never take this edit, so its version must not be merged with the edit.
 void CXDVaultraConduit::forgetEdit(const CXDChangeRecord& record) {
     const UniqueId uid = inDatabase(record);
     if (const auto row = _world.rolvane.personRow(uid)) _world.rolvane.setCommonVersion(uid, row->encoded);

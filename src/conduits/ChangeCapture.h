@@ -29,8 +29,8 @@ public:
     // person that is new also enters the location's all-contacts group.
     void addPerson(const CXRow& person, bool update);
     void addPerson(const std::optional<CXRow>& person, bool update);
-    // What the group's location has to learn. None, and a group that is shared nowhere, add nothing. Throws
-    // CXDamagedDatabase where something would count as gone that is there.
+    // Adds the changes of the group for its location. A null group, or one that is shared nowhere, adds nothing. Throws
+    // CXDamagedDatabase where a record would count as gone although its row is there.
     void addGroup(const CXGroupRef& group);
     // `group` is the group that the states are of, when there is one: its new members are then read together.
     void addComparison(const Value& prior, const Value& current, const UniqueId& guid, const RemoteLocation& location,

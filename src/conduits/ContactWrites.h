@@ -41,13 +41,13 @@ public:
     // somebody else was faster several times.
     bool write(const Place& place, const Dictionary& ours, int& code);
 
-    // What was merged and is to be taken into the database: its contents, since the last call.
+    // Contacts that were merged since the last call; the database has to take them in.
     struct Merged {
         Place place;
         Dictionary contact;
     };
     std::vector<Merged> takeMerged();
-    // What nobody has taken counts as not seen yet.
+    // Merged contacts that nobody has taken count as not seen yet.
     void giveUpMerged();
 
 private:
