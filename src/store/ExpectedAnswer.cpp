@@ -111,8 +111,10 @@ AnswerVerdict verdictOn(std::string_view method, const HttpResponse& answer) {
 }
 
 std::string accountOf(std::string_view method, const HttpResponse& answer) {
+    const std::string* target = answer.status < 400 ? answer.header("location") : nullptr;
     return std::string(method) + " was answered with " + std::to_string(answer.status) +
-           (isWebPage(answer) ? " and a web page" : "");
+           (isWebPage(answer) ? " and a web page" : "") +
+           (answer.status >= 300 && target ? ", which sends to " + *target : "");
 }
 
 } // namespace rolvane

@@ -22,7 +22,8 @@ namespace rolvane {
 //   UNLOCK     204                         200 and others                   foreign
 //   ACL        200, 201, 204, no web page  -                                207 fails, else foreign
 //
-//   every method: 3xx and 4xx, and 501, are refusals; 401, 408, 429 and 5xx are failures; 407 and 511 are foreign.
+//   every method: a redirect that only adds a slash to the same place is followed first (see Collections).
+//   3xx and 4xx, and 501, are refusals; 401, 408, 429 and 5xx are failures; 407 and 511 are foreign.
 //   Grave are 3xx, and of methods that change something all but 423, 412 to PUT, 405 to MKCOL: something follows from
 //   them.
 enum class AnswerVerdict {

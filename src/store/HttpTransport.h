@@ -45,6 +45,9 @@ struct HttpRequest {
     // request with `tooLarge`. Called on the transport's thread, only for the status `sinkStatus`.
     std::function<bool(std::string_view)> sink;
     int sinkStatus = 207;
+    // It asks for what may be a file or a collection: that the answer sends to the same place with a slash tells which,
+    // and is told to whoever asked instead of being followed (StoreSession; a transport follows nothing).
+    bool tellsKind = false;
     // Nobody waits for it yet: while there is no connection for all, those without this go first.
     bool givesWay = false;
 };

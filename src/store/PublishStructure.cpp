@@ -3,6 +3,7 @@
 #include "foundation/Log.h"
 #include "foundation/Paths.h"
 #include "foundation/PropertyList.h"
+#include "store/Collections.h"
 #include "store/StoreListing.h"
 
 #include <algorithm>
@@ -102,12 +103,13 @@ bool PublishStructure::makeTree() {
     for (Url u = bytes.cxURLByDeletingLastComponent(); !u.cxLastComponent().empty();
          u = u.cxURLByDeletingLastComponent())
         above.insert(above.begin(), u);
-    for (const Url& u : above) _session.send(StoreSession::request("MKCOL", u), [](int) { return true; });
+    for (const Url& u : above)
+        _session.send(StoreSession::request("MKCOL", namedAsCollection(u)), [](int) { return true; });
     return _files.makeCollection(tree);
 }
 
 HttpRequest PublishStructure::making(const Url& collection) const {
-    HttpRequest request = StoreSession::request("MKCOL", *_session.endpoint(collection));
+    HttpRequest request = StoreSession::request("MKCOL", *_session.collectionEndpoint(collection));
     request.givesWay = true; // a pass that reads other people's trees need not wait for it
     return request;
 }

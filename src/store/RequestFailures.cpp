@@ -155,6 +155,8 @@ std::string treeOf(const Url& name) {
 
 std::string serverWords(const HttpResponse& answer) {
     if (!answer.complete()) return cleaned(answer.detail.empty() ? description(answer.error) : answer.detail);
+    const std::string* target = answer.status >= 300 && answer.status < 400 ? answer.header("location") : nullptr;
+    if (target && !target->empty()) return cleaned("sends to " + *target);
     const std::string* type = answer.header("content-type");
     const std::string_view kind = type ? std::string_view(*type) : std::string_view();
     const std::string_view body = std::string_view(answer.body).substr(0, kLookedAt);

@@ -26,7 +26,7 @@ struct RequestFailure {
 // The answer in the server's own words, for a person: one line of at most 200 bytes, valid UTF-8, without markup,
 // control characters and characters that turn the direction of writing. Taken from a body of text/plain, HTML or XML
 // (where an XML body holds elements alone, the name of the innermost first one). Without a complete answer it is the
-// transport's reason. "" when the server said nothing.
+// transport's reason, and of a redirect where it leads to. "" when the server said nothing.
 std::string serverWords(const HttpResponse& answer);
 
 // The requests of one client that failed. Any thread.

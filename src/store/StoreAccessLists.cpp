@@ -1,6 +1,7 @@
 #include "store/StoreAccessLists.h"
 
 #include "foundation/Log.h"
+#include "store/Collections.h"
 #include "store/StorePrincipals.h"
 
 #include <algorithm>
@@ -90,7 +91,8 @@ std::optional<StoreAccessLists::OnStore> StoreAccessLists::fetch(const Url& endp
     if (!list) return std::nullopt;
 
     OnStore found;
-    found.asked = endpoint;
+    const CXDAVNode* href = response.firstChild("href");
+    found.asked = href && href->content().ends_with('/') ? namedAsCollection(endpoint) : endpoint;
     found.principals = std::make_shared<StorePrincipals>(_session, endpoint,
                                                          hrefsIn(davProperty(response, "principal-collection-set")));
     const auto owners = hrefsIn(davProperty(response, "owner"));
@@ -141,13 +143,17 @@ AccessLists StoreAccessLists::listsOf(const OnStore& found) const {
 }
 
 std::optional<AccessLists> StoreAccessLists::read(const Url& name, bool securely) {
-    const auto target = _session.endpoint(name, securely);
+    const auto target = placeOf(name, securely);
     if (!target || _session.keepsAccessLists() == false) return std::nullopt;
     const auto found = fetch(*target);
     if (!found) return std::nullopt;
     AccessLists lists = listsOf(*found);
     const std::lock_guard guard(_mutex);
     return _known[keyOf(name)] = std::move(lists);
+}
+
+std::optional<Url> StoreAccessLists::placeOf(const Url& name, bool securely) const {
+    return isAlwaysCollection(name) ? _session.collectionEndpoint(name, securely) : _session.endpoint(name, securely);
 }
 
 // Takes out whom the store does not know; false when there was somebody.
@@ -200,7 +206,7 @@ bool StoreAccessLists::set(const Url& name, bool securely, const AccessLists& as
         if (const auto seen = _known.find(key); seen != _known.end()) known = seen->second;
     }
     if (known == wanted) return true;
-    const auto target = _session.endpoint(name, securely);
+    const auto target = placeOf(name, securely);
     auto found = target && _session.keepsAccessLists() != false ? fetch(*target) : std::nullopt;
     if (!found) return false;
     const AccessLists theirs = listsOf(*found);

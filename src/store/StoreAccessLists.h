@@ -44,6 +44,7 @@ public:
 
 private:
     struct OnStore;
+    std::optional<Url> placeOf(const Url& name, bool securely) const;
     std::optional<OnStore> fetch(const Url& endpoint);
     std::optional<OnStore> fetchParent(const OnStore& below);
     AccessLists listsOf(const OnStore& found) const;

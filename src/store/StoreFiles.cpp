@@ -3,6 +3,7 @@
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
 #include "foundation/PropertyList.h"
+#include "store/Collections.h"
 #include "store/Multistatus.h"
 
 #include <atomic>
@@ -94,8 +95,14 @@ bool isAbsenceOrDenial(int status) {
 bool mayMeanACollection(int status) {
     return isAbsenceOrDenial(status) || status == 405 || (status >= 300 && status < 400);
 }
+// Of a collection named with its slash: where a file of the name lies, some servers find nothing, or nonsense, below
+// it.
 bool isInTheWay(int status) {
-    return status == 405 || status == 409 || (status >= 300 && status < 400);
+    return status == 400 || status == 404 || status == 405 || status == 409 || (status >= 300 && status < 400);
+}
+// To what was named as a collection and is none, or the other way round.
+bool mayMeanAnother(int status) {
+    return isInTheWay(status);
 }
 bool isGoneOrChanged(int status) {
     return status == 404 || status == 412;
@@ -127,6 +134,10 @@ bool StoreFiles::knownCollection(const Url& url) const {
     return !_collections.empty() && _collections.contains(url.absoluteString());
 }
 
+Url StoreFiles::asKnown(const Url& url) const {
+    return knownCollection(url) ? namedAsCollection(url) : url;
+}
+
 void StoreFiles::remember(const Url& url) {
     std::lock_guard guard(_mutex);
     if (_collections.size() >= kMaxKnownCollections) _collections.clear();
@@ -144,8 +155,10 @@ StoreFiles::Fetched StoreFiles::fetch(const Url& url, bool mayBeCollection) {
     std::optional<HttpResponse> waiting = _early.take(url);
     if (!waiting) waiting = _ahead.take(url);
     const StoreSession::Handled handled = mayBeCollection ? mayMeanACollection : isAbsenceOrDenial;
-    HttpResponse answer = waiting ? _session.judged(StoreSession::request("GET", url), std::move(*waiting), handled)
-                                  : _session.send(StoreSession::request("GET", url), handled);
+    HttpRequest request = StoreSession::request("GET", url);
+    request.tellsKind = mayBeCollection;
+    HttpResponse answer =
+        waiting ? _session.judged(request, std::move(*waiting), handled) : _session.send(std::move(request), handled);
     // httpd says 403 of a file that is replaced or removed while it is being opened, too: only what is said twice
     // counts.
     if (answer.status == 403 && !mayBeCollection) answer = _session.send(StoreSession::request("GET", url), isAbsence);
@@ -319,6 +332,7 @@ HttpResponse StoreFiles::put(const Url& name, const Url& target, const std::shar
     headers.emplace_back("Content-Type", contentType(*body));
     request.headers = std::move(headers);
     request.body = body;
+    request.tellsKind = mayBeBoth(name);
     HttpResponse answer = _session.send(std::move(request), isAny);
     _early.forget(target);
     _ahead.forget(target);
@@ -380,15 +394,30 @@ int StoreFiles::write(const Url& name, std::string text, bool securely, const st
 int StoreFiles::remove(const Url& name) {
     const auto url = _session.endpoint(name);
     if (!url) return 0;
+    const Url collection = namedAsCollection(*url);
+    const bool isCollection = knownCollection(*url) || isAlwaysCollection(name);
     forget(*url);
     _versions.forget(name.absoluteString());
     _copies.forget(name.absoluteString());
     _early.forget(*url);
     _ahead.forget(*url);
-    HttpRequest request = StoreSession::request("DELETE", *url);
-    const LockToken token = _tokens.tokenFor(url->absoluteString());
-    if (!token.empty()) request.headers.emplace_back("If", taggedCondition(*url, "<" + token.str() + ">"));
-    return _session.send(std::move(request), isAbsence).status;
+    HttpResponse answer;
+    const auto attempt = [&](const Url& target) {
+        HttpRequest request = StoreSession::request("DELETE", target);
+        const LockToken token = _tokens.tokenFor(target.absoluteString());
+        if (!token.empty()) request.headers.emplace_back("If", taggedCondition(target, "<" + token.str() + ">"));
+        answer = _session.send(std::move(request), isAny);
+        return answer.status;
+    };
+    const int code = attempt(isCollection ? collection : *url);
+    if (mayBeBoth(name)) {
+        if (isCollection && mayMeanAnother(code) && kindOf(*url) == Kind::file)
+            attempt(*url);
+        else if (!isCollection && mayMeanAnother(code) && code != 404 && kindOf(*url) == Kind::collection)
+            attempt(collection);
+    }
+    if (!succeeded(answer.status) && answer.status != 404) _session.noteFailure("DELETE", *url, answer);
+    return answer.status;
 }
 
 // ---- collections
@@ -407,7 +436,7 @@ StoreFiles::Kind StoreFiles::kindOf(const Url& url, EntityTag* tag) {
 bool StoreFiles::makeCollection(const Url& name) {
     const auto url = _session.endpoint(name);
     if (!url) return false;
-    const HttpResponse answer = _session.send(StoreSession::request("MKCOL", *url), isInTheWay);
+    const HttpResponse answer = _session.send(StoreSession::request("MKCOL", namedAsCollection(*url)), isInTheWay);
     if (answer.status == 405 && knownCollection(*url)) return true;
     if (answer.ok()) {
         remember(*url);
@@ -430,12 +459,13 @@ bool StoreFiles::makeCollection(const Url& name) {
 bool StoreFiles::moveIntoCollection(const Url& url, const EntityTag& tag) {
     const Url making = url.cxURLByDeletingLastComponent().cxURLByAppendingComponent(url.cxLastComponent() +
                                                                                     std::string(kMakingSuffix));
-    const HttpResponse made = _session.send(StoreSession::request("MKCOL", making), isInTheWay);
+    const Url collection = namedAsCollection(making);
+    const HttpResponse made = _session.send(StoreSession::request("MKCOL", collection), isInTheWay);
     if (!made.ok() && made.status != 405) return false;
     HttpRequest copy = StoreSession::request("COPY", url);
     copy.headers = {{"Destination", stateURL(making).absoluteString()}, {"Overwrite", "T"}, {"Depth", "0"}};
     if (!_session.send(std::move(copy)).ok()) return false;
-    HttpRequest move = StoreSession::request("MOVE", making);
+    HttpRequest move = StoreSession::request("MOVE", collection);
     move.headers = {{"Destination", url.absoluteString()}, {"Overwrite", "T"}};
     if (!tag.empty()) move.headers.emplace_back("If", taggedCondition(url, "[" + tag.str() + "]"));
     const HttpResponse moved = _session.send(std::move(move), isGoneOrChanged);

@@ -78,6 +78,7 @@ private:
     Kind kindOf(const Url& url, EntityTag* tag = nullptr);
     bool moveIntoCollection(const Url& url, const EntityTag& tag); // `tag`: the file's; empty when the store gives none
 
+    Url asKnown(const Url& url) const; // with a slash when it is known to be a collection
     bool knownCollection(const Url& url) const;
     void remember(const Url& url);
     void forget(const Url& url);

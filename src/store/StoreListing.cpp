@@ -26,11 +26,6 @@ std::optional<Date> serverDateOf(const HttpResponse& answer) {
     return date ? Date::fromHTTP(*date) : std::nullopt;
 }
 
-std::string asDirectory(const Url& url) {
-    const std::string& text = url.absoluteString();
-    return text.ends_with('/') ? text : text + "/";
-}
-
 // True when the name lies directly inside the container.
 bool isMember(const Url& name, const Url& container) {
     return name.cxURLByDeletingLastComponent().absoluteString() == container.absoluteString();
@@ -75,9 +70,9 @@ StoreListing::AskedRef StoreListing::ask(const std::vector<Url>& containers, con
     auto asked = std::make_shared<Asked>();
     std::vector<HttpRequest> requests;
     for (const Url& name : containers) {
-        const auto url = _session.endpoint(name);
+        const auto url = _session.collectionEndpoint(name);
         if (!url) return asked; // of none of them then
-        HttpRequest r = StoreSession::propfind(Url(asDirectory(*url)), 1, tagged && *tagged == name);
+        HttpRequest r = StoreSession::propfind(*url, 1, tagged && *tagged == name);
         r.limits = {300, 60, kListingBytes, 64u << 10};
         auto reading = std::make_shared<Staged>();
         r.sink = [reading](std::string_view bytes) { return reading->sound = reading->reader.feed(bytes); };
@@ -94,7 +89,7 @@ StoreListing::AskedRef StoreListing::ask(const std::vector<Url>& containers, con
 
 StoreListing::Members StoreListing::read(Asked& asked, size_t number) {
     Members out;
-    const Url place = *_session.endpoint(asked.containers[number]);
+    const Url place = *_session.collectionEndpoint(asked.containers[number]);
     const HttpResponse answer =
         _session.judged(StoreSession::request("PROPFIND", place), std::move(asked.answers[number]),
                         [](int status) { return status == 404; });

@@ -4,6 +4,7 @@
 #include "foundation/Log.h"
 #include "foundation/Paths.h"
 #include "store/CXDAVManagerImpl.h"
+#include "store/Collections.h"
 #include "store/LockAnswers.h"
 
 #include <algorithm>
@@ -124,8 +125,10 @@ void releaseLeftBehind(CXDAVManager::Impl& client, const std::string& url, LockL
 } // namespace
 
 StoreLock::StoreLock(std::shared_ptr<CXDAVManager::Impl> client, Url name, LockLedger ledger, const Clock& clock)
-    : _client(client), _name(std::move(name)), _endpoint(client->session.endpoint(_name)), _ledger(std::move(ledger)),
-      _clock(clock) {}
+    : _client(client), _name(std::move(name)),
+      _endpoint(isAlwaysCollection(_name) ? client->session.collectionEndpoint(_name)
+                                          : client->session.endpoint(_name)),
+      _ledger(std::move(ledger)), _clock(clock) {}
 
 // A LOCK request: a new lock whose owner carries the mark, or the refresh of the token's.
 HttpResponse StoreLock::ask(const LockToken& refreshed, const std::string& mark) {

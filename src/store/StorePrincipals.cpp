@@ -1,6 +1,7 @@
 #include "store/StorePrincipals.h"
 
 #include "store/CXDAVNode.h"
+#include "store/Collections.h"
 
 #include <algorithm>
 
@@ -77,7 +78,7 @@ std::optional<std::string> StorePrincipals::hrefFor(const std::string& name) {
         if (lookAt(collection.cxURLByAppendingComponent(name), 0, name, href) == Answer::found)
             return _known[name] = href;
     for (const Url& collection : _collections) {
-        const Answer answer = lookAt(collection, 1, name, href);
+        const Answer answer = lookAt(namedAsCollection(collection), 1, name, href);
         if (answer == Answer::found) return _known[name] = href;
         answered = answered || answer == Answer::notThere;
     }

@@ -2,6 +2,7 @@
 
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "store/Collections.h"
 #include "store/ExpectedAnswer.h"
 #include "store/Multistatus.h"
 
@@ -100,6 +101,11 @@ std::optional<Url> StoreSession::endpoint(const Url& name, bool securely) const 
     return _map.endpointFor(name, securely);
 }
 
+std::optional<Url> StoreSession::collectionEndpoint(const Url& name, bool securely) const {
+    const auto url = endpoint(name, securely);
+    return url ? std::optional(namedAsCollection(*url)) : std::nullopt;
+}
+
 HttpRequest StoreSession::request(std::string method, Url url) {
     HttpRequest r;
     r.method = std::move(method);
@@ -143,6 +149,16 @@ bool StoreSession::signIn() {
     return true;
 }
 
+HttpResponse StoreSession::performed(HttpRequest request) {
+    const HttpRequest asked = request;
+    return followed(asked, _transport->perform(std::move(request)));
+}
+
+HttpResponse StoreSession::followed(const HttpRequest& asked, HttpResponse answer) {
+    const auto place = asked.tellsKind ? std::nullopt : redirectToCollection(asked.url, answer);
+    return place ? _transport->perform(sentTo(asked, *place)) : answer;
+}
+
 HttpResponse StoreSession::believed(const HttpRequest& asked, HttpResponse answer) {
     if (answer.status == 401) {
         std::lock_guard guard(_mutex);
@@ -172,7 +188,7 @@ bool StoreSession::isProven(const HttpRequest& asked) {
 }
 
 bool StoreSession::hasDone(const HttpRequest& asked) {
-    const auto look = [&](HttpRequest looking) { return _transport->perform(std::move(looking)); };
+    const auto look = [&](HttpRequest looking) { return performed(std::move(looking)); };
     if (asked.method == "PUT") {
         const HttpResponse there = look(request("GET", asked.url));
         return there.status == 200 && asked.body && there.body == *asked.body;
@@ -198,7 +214,7 @@ bool StoreSession::hasDone(const HttpRequest& asked) {
 }
 
 HttpResponse StoreSession::judged(const HttpRequest& asked, HttpResponse answer, Handled handled) {
-    HttpResponse heeded = believed(asked, std::move(answer));
+    HttpResponse heeded = believed(asked, followed(asked, std::move(answer)));
     const bool succeeded = heeded.ok() || (heeded.status == 207 && asked.method == "PROPFIND");
     if (!succeeded && !(heeded.complete() && handled && handled(heeded.status)))
         noteFailure(asked.method, asked.url, heeded);
@@ -216,7 +232,7 @@ HttpResponse StoreSession::send(HttpRequest request, Handled handled) {
 
 HttpResponse StoreSession::sendUnnoted(HttpRequest request) {
     const HttpRequest asked = request;
-    return believed(asked, signIn() ? _transport->perform(std::move(request)) : unsent());
+    return believed(asked, signIn() ? performed(std::move(request)) : unsent());
 }
 
 std::vector<HttpResponse> StoreSession::sendAll(std::vector<HttpRequest> requests, Handled handled) {
@@ -238,12 +254,14 @@ HttpResponse StoreSession::options() {
 
 // The answers to an OPTIONS of the account's tree, which is heeded, and to the requests, sent with it.
 std::vector<HttpResponse> StoreSession::optionsAndMore(std::vector<HttpRequest> requests) {
-    const auto base = endpoint(_account.baseLocationFor(_account.user));
+    const auto base = collectionEndpoint(_account.baseLocationFor(_account.user));
     if (!base) return std::vector<HttpResponse>(requests.size() + 1);
     HttpRequest r = request("OPTIONS", *base);
     r.limits = {20, 10, 1u << 20, 64u << 10};
     requests.insert(requests.begin(), std::move(r));
+    const std::vector<HttpRequest> asked = requests;
     std::vector<HttpResponse> answers = _transport->performAll(std::move(requests));
+    for (size_t i = 0; i < answers.size(); ++i) answers[i] = followed(asked[i], std::move(answers[i]));
     const HttpResponse& answer = answers.front();
     if (answer.complete() && (answer.ok() || answer.status == 403 || answer.status == 404) && announcesDav1(answer)) {
         _davSeen = steadyMilliseconds();
@@ -291,6 +309,9 @@ CXDAVError StoreSession::errorFrom(const HttpResponse& answer, const char* asked
     if (answer.status == 401)
         return {kCXDAVErrorAuthentication, where + " refused the user name or the password of \"" +
                                                _account.user.str() + "\". Correct the account."};
+    if (answer.status >= 300 && answer.status < 400 && answer.header("location"))
+        return {kCXDAVErrorBadServerResponse, where + " sends " + asked + " to " + *answer.header("location") +
+                                                  ", where nothing was sent. Check the account's endpoint."};
     return {kCXDAVErrorBadServerResponse, where + " answered " + asked + " with " + std::to_string(answer.status) +
                                               " and is no WebDAV server. Check the account's endpoint."};
 }
@@ -310,7 +331,7 @@ bool StoreSession::canReach(CXDAVError& error, const std::function<void()>& mean
     if (meanwhile) meanwhile();
     // Servers may answer OPTIONS without looking at the login, so the login is proven once by a request that needs it.
     std::vector<HttpRequest> proof;
-    if (const auto tree = endpoint(_account.baseLocationFor(_account.user)); tree && needsLoginProof)
+    if (const auto tree = collectionEndpoint(_account.baseLocationFor(_account.user)); tree && needsLoginProof)
         proof.push_back(propfind(*tree, 0));
     const std::vector<HttpResponse> answers = optionsAndMore(std::move(proof));
     for (size_t i = 0; i < answers.size(); ++i) {
@@ -320,7 +341,7 @@ bool StoreSession::canReach(CXDAVError& error, const std::function<void()>& mean
         if (answer.complete() && answer.status != 401 && !isForeign && _davSeen != 0) continue;
         const char* asked = i == 0 ? "OPTIONS" : "PROPFIND";
         error = errorFrom(answer, asked);
-        noteFailure(asked, endpoint(_account.baseLocationFor(_account.user)).value_or(Url()), answer);
+        noteFailure(asked, collectionEndpoint(_account.baseLocationFor(_account.user)).value_or(Url()), answer);
         std::lock_guard guard(_mutex);
         _loginRefused = _loginRefused || answer.status == 401;
         return false;

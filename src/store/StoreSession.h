@@ -30,6 +30,8 @@ public:
 
     // The endpoint of a name, or nothing.
     std::optional<Url> endpoint(const Url& name, bool securely = false) const;
+    // The same of what is known to be a collection, with a slash at its end.
+    std::optional<Url> collectionEndpoint(const Url& name, bool securely = false) const;
     // The name of an href, or nothing; both as CXDAVAccount's.
     std::optional<Url> nameFor(std::string_view href) const { return _map.nameFor(href); }
 
@@ -39,7 +41,7 @@ public:
     // Sends the request. What no WebDAV server answers (see ExpectedAnswer) is an `unreachable`. A refusal is believed
     // only of a server that has proven itself within half a minute, and a success that a portal gives, too, only when
     // the server has proven itself anew and shows what it has done. An answer that is neither success nor handled is
-    // noted among the failures.
+    // noted among the failures. A redirect to the same place with a slash is followed.
     HttpResponse send(HttpRequest request, Handled handled = nullptr);
     std::vector<HttpResponse> sendAll(std::vector<HttpRequest> requests, Handled handled = nullptr);
     // The same, and nothing is noted: whoever asks in more than one way notes the failure when all have failed.
@@ -75,6 +77,8 @@ public:
 private:
     bool signIn();
     bool isDavServer();
+    HttpResponse performed(HttpRequest request);
+    HttpResponse followed(const HttpRequest& asked, HttpResponse answer);
     HttpResponse believed(const HttpRequest& asked, HttpResponse answer);
     bool isProven(const HttpRequest& asked);
     bool hasDone(const HttpRequest& asked);

@@ -78,7 +78,7 @@ TEST_F(Publishing, ARefusalDoesNotCountWhenTheOtherClientHasMadeTheStructureMean
     bool other = false;
     std::string serial;
     alice.wire->intercept([&](const HttpRequest& request) -> std::optional<HttpResponse> {
-        if (request.method != "MKCOL" || !request.url.encodedPath().ends_with("/People") || other) return std::nullopt;
+        if (request.method != "MKCOL" || !request.url.encodedPath().ends_with("/People/") || other) return std::nullopt;
         other = second.manager.sanityCheckPublishStructureCreate(true);
         serial = world.contents("info");
         return answerOf(403);
@@ -92,7 +92,7 @@ TEST_F(Publishing, ARefusalDoesNotCountWhenTheOtherClientHasMadeTheStructureMean
 TEST_F(Publishing, WhatTheOtherClientHadNoTimeForIsMadeAfterARefusal) {
     Client second(world);
     alice.wire->intercept([&](const HttpRequest& request) -> std::optional<HttpResponse> {
-        if (request.method != "MKCOL" || !request.url.encodedPath().ends_with("/People/9")) return std::nullopt;
+        if (request.method != "MKCOL" || !request.url.encodedPath().ends_with("/People/9/")) return std::nullopt;
         alice.wire->intercept({}); // once
         EXPECT_TRUE(second.manager.createDirectoryAtAURL(second.at("People/9")));
         return answerOf(403);
