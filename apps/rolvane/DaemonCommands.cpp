@@ -9,6 +9,7 @@
 #include "Subscriptions.h"
 #include "Withdrawn.h"
 
+#include "conduits/EndedPublication.h"
 #include "daemon/DaemonControl.h"
 #include "engine/DatabaseCare.h"
 #include "engine/EngineState.h"
@@ -137,6 +138,28 @@ std::string refusedText(const Json& record) {
                        refusalReason(record));
 }
 
+// Of no interest once something is published again.
+Json endedJson(const Preferences& preferences, bool publishes) {
+    const auto ended = endedPublication(preferences);
+    if (!ended || publishes) return nullptr;
+    Json users = Json::array();
+    for (const UserName& user : ended->mayStillRead) users.push_back(user.str());
+    return {{"date", ended->when.toISO8601()},
+            {"why", ended->replaced ? "replaced" : "goneOrForbidden"},
+            {"mayStillRead", users}};
+}
+
+std::string endedText(const Json& ended) {
+    std::string users;
+    for (const Json& user : ended["mayStillRead"]) users += (users.empty() ? "" : ", ") + user.get<std::string>();
+    return fmt::format(
+        "on {}: {}. `rolvane publish` publishes again.{}", ended["date"].get<std::string>(),
+        ended["why"] == "replaced" ? "another publication of yours lies in its place on the store, made from another "
+                                     "computer perhaps"
+                                   : "the store has nothing of it any more, or does not let you in",
+        users.empty() ? "" : " The store has not taken yet that you took rights away from " + users + ".");
+}
+
 Json status(Context& context) {
     CXRolvane& database = context.database();
     Preferences& preferences = Preferences::shared();
@@ -163,6 +186,7 @@ Json status(Context& context) {
             {"daemon", pid ? Json(*pid) : Json()},
             {"store", storeStatus()},
             {"published", {{"everything", publication.everything()}, {"groups", groups}}},
+            {"publicationEnded", endedJson(preferences, publication.anything())},
             {"leftOnStore", anythingLeftOnStore(database, preferences)},
             {"subscriptions", subscriptions},
             {"withdrawn", withdrawnJson()},
@@ -225,6 +249,7 @@ void showStatus(Context& context) {
         if (!store["reachable"].get<bool>()) row("", store["toDo"].get<std::string>());
     }
     row("Published", publishedText(s["published"]));
+    if (!s["publicationEnded"].is_null()) row("", "ended " + endedText(s["publicationEnded"]));
     if (s["leftOnStore"])
         row("", "files of what was withdrawn are still on the store; the same `rolvane unpublish` again removes them");
     row("Subscribed", subscribedText(s["subscriptions"]));

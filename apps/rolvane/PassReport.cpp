@@ -103,11 +103,13 @@ void reportIn(PassReport& report, const PassTree& tree, bool storeIsTold, Date a
     const PassDirection& in = tree.in;
     if (tree.ended)
         return add(report, kRefused,
-                   isOwn(tree) ? "The publication has ended: the store has nothing of it any more, or does not let you "
-                                 "read it. `rolvane publish` publishes again."
-                               : fmt::format("{} no longer shares with you, and what came from there has left: "
-                                             "`rolvane withdrawn list` shows what is kept of it.",
-                                             tree.user.str()));
+                   isOwn(tree)
+                       ? "The publication has ended: the store has nothing of it any more, does not let you read "
+                         "it, or has another one in its place. `rolvane status` tells more, and `rolvane "
+                         "publish` publishes again."
+                       : fmt::format("{} no longer shares with you, and what came from there has left: "
+                                     "`rolvane withdrawn list` shows what is kept of it.",
+                                     tree.user.str()));
     if (tree.leftAlone)
         return add(report, kFailed,
                    isOwn(tree) ? "Your tree on the store was older than expected, or incomplete; it is published again."

@@ -2,6 +2,7 @@
 
 #include "Shares.h"
 
+#include "conduits/EndedPublication.h"
 #include "contacts/Constants.h"
 #include "contacts/Identifier.h"
 #include "contacts/SharingDates.h"
@@ -129,7 +130,8 @@ void forgetPublication(Preferences& preferences) {
         state.conduitObjectForKey(conduit, "priorState").remove(kSelf.str());
     state.withConduitData([](Dictionary& data) { forgetRefusedChanges(data); });
     state.noteRefusedByOwnStore(0, std::nullopt);
-    for (const char* note : {kCXDUnsavedAccessLists, kCXDUnderWay}) preferences.remove(kDaemonDomain, note);
+    for (const char* note : {kCXDUnsavedAccessLists, kCXDUnderWay, kCXDEndedPublication})
+        preferences.remove(kDaemonDomain, note);
     dropPending(state, [](const CXDChangeRecord& record) { return record.changeMadeByDataOwner(); });
     state.syncPrefs();
 }

@@ -188,6 +188,16 @@ void CXDAVACLManager::resume(const Array& changes) {
     }
 }
 
+std::vector<UserName> CXDAVACLManager::deniedIn(const Array& changes) {
+    std::vector<UserName> names;
+    for (const Value& each : changes) {
+        const UserName principal(each.dictionary()[kPrincipal].string());
+        if (!each.dictionary()[kGrant].boolean() && std::find(names.begin(), names.end(), principal) == names.end())
+            names.push_back(principal);
+    }
+    return names;
+}
+
 bool CXDAVACLManager::save() {
     if (!_publisher) return true;
     CXACLManager::save();

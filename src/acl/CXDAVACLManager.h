@@ -33,6 +33,8 @@ public:
     bool save() override;
     Array unsaved() const override;
     void resume(const Array& changes) override;
+    // Whose rights such changes take away; in order, each name once.
+    static std::vector<UserName> deniedIn(const Array& changes);
     // False: the owner's list could not be read yet. What cannot be read of somebody else's location is no access.
     bool isKnown() const override { return _loaded || !_publisher; }
 

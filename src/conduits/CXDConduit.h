@@ -121,6 +121,9 @@ protected:
     virtual WithdrawalNotice* withdrawalNotice() const; // base: none; nothing is kept and nobody is told
     // Whether the state that was just read of a user's store is to be believed. Base: always.
     virtual bool isTrusted(const UserName& user, const Dictionary& state);
+    // The store forbids or has lost the owner's published tree, or (`replaced`) has another one. Called before anything
+    // of the publication is forgotten. Base: nothing.
+    virtual void ownPublicationEnds(const Url& /*base*/, bool /*replaced*/) {}
     // Whether access lists are kept at the source, so that somebody else may have changed them. Base: yes.
     virtual bool keepsAccessLists() const { return true; }
 

@@ -131,6 +131,7 @@ void CXDConduit::readLocation(const RemoteLocation& location, Dictionary& state)
     const bool isNew = !_engine.conduitObjectForKey(*conduitID(), kPriorState).contains(user.str());
     const auto userState = fetchWorkingState(*base, &forbidden, isNew && user != kSelf);
     if (forbidden) {
+        if (user == kSelf) ownPublicationEnds(*base, false);
         const CXSubscriptionRef subscription = database().findSubscriptionWithRemoteLocation(location);
         _engine.revokeRemoteLocation(location, subscription ? std::optional(subscription->uniqueId()) : std::nullopt);
         removeRecordsAssociateWithRemoteLocation(location);
@@ -269,6 +270,7 @@ void CXDConduit::compareUser(const UserName& user, const Dictionary& prior, cons
     Dictionary before = known ? *known : Dictionary();
     const Value knownSerial = before[kSerialNumber];
     if (knownSerial.isString() && knownSerial.string() != serial.string()) {
+        if (user == kSelf) ownPublicationEnds(*base, true);
         cancelSharingTo(baseText);
         _engine.treeWasLookedAt(user, TreeLook::ended);
         return;

@@ -1,6 +1,7 @@
 #include "conduits/CXDVaultraConduit.h"
 
 #include "acl/CXDAVACLManager.h"
+#include "conduits/EndedPublication.h"
 #include "conduits/LocalizedText.h"
 #include "conduits/PublishedLayout.h"
 #include "conduits/StoreComparison.h"
@@ -346,6 +347,8 @@ bool CXDVaultraConduit::allGroupHas(const char* property) {
 
 CXDChangeRecords CXDVaultraConduit::changeRecords() {
     CXDChangeRecords records = CXDConduit::changeRecords();
+    if (_world.rolvane.allGroup()->valueForProperty(kCXRemoteLocationProperty) && endedPublication(_world.preferences))
+        _world.preferences.remove(kDaemonDomain, kCXDEndedPublication); // published again since
     _publishesAgain = !engine().conduitObjectForKey(kConduitCX, kPublishAgain).empty();
     leaveUnlistedOut(records);
     _read.clear();
@@ -403,6 +406,36 @@ void CXDVaultraConduit::restoreAccessLists() {
               &CXACLManager::grantReadPermissionForGUID, &CXACLManager::denyReadPermissionForGUID);
     changeACL(*manager, everybody, cxDifferencesBetweenArray(arrayOf(manager->principalsWithAllAccess()), writers), {},
               &CXACLManager::grantReadWritePermissionForGUID, &CXACLManager::denyReadWritePermissionForGUID);
+}
+
+// Lists that another publication has are not this database's to change.
+void CXDVaultraConduit::ownPublicationEnds(const Url& base, bool replaced) {
+    if (!_world.rolvane.allGroup()->valueForProperty(kCXRemoteLocationProperty)) return; // by the owner's doing
+    const Dictionary prior = engine().conduitObjectForKey(kConduitCX, kPriorState)[kSelf.str()].dictionary();
+    const auto taken = [&](const char* property) {
+        const auto listed = _world.rolvane.allGroup()->multiValueForProperty(property);
+        return takenAway(prior, property, listed ? listed->_allValues() : Array());
+    };
+    const Array readers = taken(kCXReadSharingACLProperty), writers = taken(kCXReadWriteSharingACLProperty);
+    const Dictionary unsaved = _world.preferences.get(kDaemonDomain, kUnsavedAccessListsKey).dictionary();
+    EndedPublication ended{_world.clock.now(), replaced, {}};
+    if (replaced) {
+        const Array before = arrayOf(CXDAVACLManager::deniedIn(unsaved[base.absoluteString()].array()));
+        for (const Value& name : cxArrayCombinedWithArray(before, cxArrayCombinedWithArray(readers, writers)))
+            ended.mayStillRead.emplace_back(name.string());
+    } else if (const auto manager = keepsAccessLists() ? ACLManagerForRemoteLocation(base) : nullptr) {
+        const UniqueId everybody{std::string(layout::kAllGroup)};
+        changeACL(*manager, everybody, Dictionary{{kDeletions, readers}}, {}, &CXACLManager::grantReadPermissionForGUID,
+                  &CXACLManager::denyReadPermissionForGUID);
+        changeACL(*manager, everybody, Dictionary{{kDeletions, writers}}, {},
+                  &CXACLManager::grantReadWritePermissionForGUID, &CXACLManager::denyReadWritePermissionForGUID);
+        saveACLs(); // at once: the process may end with the publication
+        ended.mayStillRead = CXDAVACLManager::deniedIn(manager->unsaved());
+    }
+    CXLog("The publication has ended: %@.",
+          replaced ? "another one lies in its place" : "the store forbids it, or has nothing of it any more");
+    noteEndedPublication(_world.preferences, ended);
+    _world.alert.tell(noticeOf(ended));
 }
 
 // Until all of it is written, what the owner's tree says is not news, and nobody is told that the owner has been there.
@@ -631,7 +664,9 @@ bool CXDVaultraConduit::saveACLs() {
     awaitStructure();
     const Dictionary unsaved = _world.preferences.get(kDaemonDomain, kUnsavedAccessListsKey).dictionary();
     if (!_vaultraOffLine)
-        for (const auto& [location, changes] : unsaved) ACLManagerForRemoteLocation(Url(location));
+        for (const auto& [location, changes] : unsaved) // those of another account wait until it is back
+            if (engine().userForRemoteLocation(RemoteLocation(location)) == kSelf)
+                ACLManagerForRemoteLocation(Url(location));
     const bool done = CXDConduit::saveACLs();
     noteUnsavedAccessLists();
     return done;
@@ -647,6 +682,11 @@ void CXDVaultraConduit::noteUnsavedAccessLists() {
         }
     if (now == before) return;
     _world.preferences.set(kDaemonDomain, kUnsavedAccessListsKey, now.empty() ? Value() : Value(now));
+    const auto own = baseLocationForUser(realUserFromUser(kSelf));
+    auto ended = endedPublication(_world.preferences);
+    if (!ended || ended->replaced || !own || now.contains(own->absoluteString())) return;
+    ended->mayStillRead.clear();
+    noteEndedPublication(_world.preferences, *ended);
 }
 
 bool CXDVaultraConduit::keepsAccessLists() const {

@@ -110,6 +110,8 @@ protected:
     Preferences& preferences() const override { return _world.preferences; }
     bool keepsAccessLists() const override; // as the server announces it
     WithdrawalNotice* withdrawalNotice() const override { return _world.withdrawals; }
+    // Sends what waits for the lists, tells the person and leaves a note.
+    void ownPublicationEnds(const Url& base, bool replaced) override;
     // A tree that was set back or has lost its lists says nothing about anybody's contacts, and is left alone. The
     // owner's own is published again.
     bool isTrusted(const UserName& user, const Dictionary& state) override;

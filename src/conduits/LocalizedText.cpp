@@ -22,6 +22,16 @@ const std::map<std::string_view, const char*>& builtInTexts() {
          "which \"rolvane import\" takes."},
         {"SHARING_WITHDRAWN_EMPTY", "{user} shares no contacts with you. The subscription has ended; there was nothing "
                                     "to remove."},
+        {"SHARING_ENDED_HEADER", "Your contacts are not published any more"},
+        {"SHARING_ENDED", "The store has nothing of your publication any more, or does not let you in. Your contacts "
+                          "stay as they are on "
+                          "this computer. \"rolvane publish\" publishes them again."},
+        {"SHARING_ENDED_REPLACED",
+         "On the store lies another publication of yours, made from another computer perhaps. Your contacts stay as "
+         "they are on this computer, and nothing there was changed. \"rolvane publish\" publishes them from here."},
+        {"SHARING_ENDED_RIGHTS", "You have taken rights away from {users}, and the store does not know of it yet: what "
+                                 "is left there may still be read."},
+        {"AND", "and"},
         {"OK", "OK"},
     };
     return texts;
@@ -34,6 +44,16 @@ std::string localizedText(const char* key) {
     if (translated != key && std::string_view(translated) != key) return translated;
     const auto found = builtInTexts().find(key);
     return found == builtInTexts().end() ? key : found->second;
+}
+
+std::string localizedText(const char* key, std::initializer_list<std::pair<std::string_view, std::string>> values) {
+    std::string text = localizedText(key);
+    for (const auto& [name, value] : values) {
+        const std::string mark = "{" + std::string(name) + "}";
+        for (size_t at = text.find(mark); at != std::string::npos; at = text.find(mark, at + value.size()))
+            text.replace(at, mark.size(), value);
+    }
+    return text;
 }
 
 } // namespace rolvane

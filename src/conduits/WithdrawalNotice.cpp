@@ -8,16 +8,6 @@
 namespace rolvane {
 namespace {
 
-// The text with every "{name}" replaced by its value.
-std::string filled(std::string text, std::initializer_list<std::pair<std::string_view, std::string>> values) {
-    for (const auto& [name, value] : values) {
-        const std::string mark = "{" + std::string(name) + "}";
-        for (size_t at = text.find(mark); at != std::string::npos; at = text.find(mark, at + value.size()))
-            text.replace(at, mark.size(), value);
-    }
-    return text;
-}
-
 const char* messageFor(const WithdrawnContacts& withdrawn) {
     if (withdrawn.file.empty()) return "SHARING_WITHDRAWN_EMPTY";
     return withdrawn.people == 1 ? "SHARING_WITHDRAWN_ONE" : "SHARING_WITHDRAWN";
@@ -38,10 +28,10 @@ std::optional<WithdrawnContacts> WithdrawalNotice::keep(CXRolvane& database, con
 
 void WithdrawalNotice::tell(const WithdrawnContacts& withdrawn) {
     UserAlert::Text text;
-    text.header = filled(localizedText("SHARING_WITHDRAWN_HEADER"), {{"user", withdrawn.user.str()}});
-    text.message =
-        filled(localizedText(messageFor(withdrawn)),
-               {{"user", withdrawn.user.str()}, {"count", std::to_string(withdrawn.people)}, {"file", withdrawn.file}});
+    text.header = localizedText("SHARING_WITHDRAWN_HEADER", {{"user", withdrawn.user.str()}});
+    text.message = localizedText(
+        messageFor(withdrawn),
+        {{"user", withdrawn.user.str()}, {"count", std::to_string(withdrawn.people)}, {"file", withdrawn.file}});
     text.defaultButton = localizedText("OK");
     text.icon = "Rolvane";
     _alert.tell(text);

@@ -237,11 +237,13 @@ void EngineState::claim(int64_t shareCount, const std::optional<UserName>& user)
         _preferences.set(kDaemonDomain, kCXDLastOstrelUser, *user);
 }
 
+// Whose rights were taken away keeps to be sent: the access lists' changes belong to the account's tree, whatever
+// database it is filled from.
 void EngineState::reset() {
     CXDLog("Reset!");
     for (const char* key : {kCXDPendingChanges, kCXDConduitData, kCXDVaultraConduitLastSyncDate,
                             kCXDCXConduitLastSyncDate, kCXDLocalConduitLastSyncDate, kCXDShareCount, kCXDLastOstrelUser,
-                            kCXDUnsavedAccessLists, kCXDConduitDataIntent, kCXDArrivalsIntent, kCXDUnderWay})
+                            kCXDConduitDataIntent, kCXDArrivalsIntent, kCXDUnderWay})
         _preferences.remove(kDaemonDomain, key);
     _preferences.synchronize(kDaemonDomain);
     dropConduitData();

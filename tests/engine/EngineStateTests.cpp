@@ -164,6 +164,14 @@ TEST(EngineMemory, AResetForgetsEverythingButTheDebugLevel) {
     EXPECT_TRUE(world.engine->conduitData().empty());
 }
 
+TEST(EngineMemory, AResetKeepsWhatTheAccessListsWaitFor) {
+    World world;
+    world.start();
+    world.preferences.set(kDaemonDomain, kCXDUnsavedAccessLists, Dictionary{{"https://store/ann/", Array{}}});
+    world.engine->reset();
+    EXPECT_TRUE(world.stored(kCXDUnsavedAccessLists));
+}
+
 class ShareCount : public ::testing::Test {
 protected:
     ShareCount() { world.start(); }
