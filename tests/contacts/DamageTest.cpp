@@ -1,5 +1,6 @@
 // Files that say two things at once: what an index does not know and a row says is there is nobody's deletion.
 
+#include "DamagedIndex.h"
 #include "TestDatabase.h"
 
 #include "contacts/DamagedDatabase.h"
@@ -33,25 +34,9 @@ struct DamagedDatabase : TestDatabase {
         }
         (*this)->save();
     }
-    // An entry is lost or wrong in one b-tree alone: the schema is told to look elsewhere for a moment.
     void alone(const std::string& index, const std::string& change) {
         database.reset();
-        Sqlite file(path, 1000);
-        const int64_t root = file.integer("SELECT rootpage FROM sqlite_schema WHERE name='" + index + "'");
-        std::string sql;
-        {
-            auto s = file.statement("SELECT sql FROM sqlite_schema WHERE name='" + index + "'");
-            ASSERT_TRUE(s.step());
-            sql = s.text(0);
-        }
-        // Without the index in the schema a change of the table does not reach it.
-        file.execute("PRAGMA writable_schema=ON; CREATE TABLE kept AS SELECT * FROM sqlite_schema WHERE name='" +
-                     index + "'; DELETE FROM sqlite_schema WHERE name='" + index + "'; PRAGMA writable_schema=RESET;");
-        file.execute(change);
-        file.execute("PRAGMA writable_schema=ON; INSERT INTO sqlite_schema SELECT * FROM kept; DROP TABLE kept; "
-                     "PRAGMA writable_schema=RESET;");
-        EXPECT_EQ(file.integer("SELECT rootpage FROM sqlite_schema WHERE name='" + index + "'"), root);
-        EXPECT_NE(sql, "");
+        changeWithout(path, index, change);
     }
     void reopenDatabase() { database = open(); }
     std::vector<std::string> everybody() {
@@ -66,15 +51,9 @@ struct DamagedDatabase : TestDatabase {
     const std::vector<std::string> all{"Ada:CXPerson", "Ben:CXPerson", "Cleo:CXPerson", "Dora:CXPerson"};
 };
 
-// As if a bit of the entry had turned: the index has it under another kind.
-constexpr const char* kBenIsNoPerson = "UPDATE records SET kind=9 WHERE uid='Ben:CXPerson'";
-constexpr const char* kBenIsAPerson = "UPDATE records SET kind=1 WHERE uid='Ben:CXPerson'";
-
 void loseBenInTheIndex(DamagedDatabase& d) {
     d.database.reset();
-    Sqlite(d.path, 1000).execute(kBenIsNoPerson); // in the table and all indexes
-    d.alone("records_location", kBenIsAPerson);   // and back, but for this one
-    d.alone("records_location", "SELECT 1");
+    loseInTheIndex(d.path, "Ben:CXPerson");
     d.reopenDatabase();
 }
 
@@ -144,7 +123,7 @@ TEST(Damage, RowsThatCannotBeBelievedAreNotMadeTheTruthByARepair) {
     refuses(
         [](DamagedDatabase& d) {
             d.database.reset();
-            Sqlite(d.path, 1000).execute(kBenIsNoPerson);
+            Sqlite(d.path, 1000).execute("UPDATE records SET kind=9 WHERE uid='Ben:CXPerson'");
         },
         "another kind");
     refuses(
