@@ -10,7 +10,7 @@ TESTS  ?=
 CTEST   = ctest -j$(JOBS) --no-tests=error --output-on-failure $(if $(TESTS),-R '$(TESTS)')
 
 .DEFAULT_GOAL := help
-.PHONY: help setup build demo test worlds asan tsan fuzz bench lint format install deb clean
+.PHONY: help setup build demo test worlds asan tsan fuzz bench lint format install install-symbols deb clean
 
 help:
 	@echo 'make demo              set up, build, and show the main job on a private store'
@@ -22,7 +22,8 @@ help:
 	@echo 'make lint              formatting, room order, clang-tidy; make format mends the first'
 	@echo 'make build             only build (release)'
 	@echo 'make install           install under PREFIX (/usr/local), DESTDIR is honoured'
-	@echo 'make deb               a Debian package in build/release'
+	@echo 'make install-symbols   what a debugger wants to know of it, under PREFIX/lib/debug'
+	@echo 'make deb               a Debian package in build/release, and one with the symbols'
 	@echo 'make setup             install the Debian packages that building and testing need'
 	@echo 'make clean             remove build/'
 
@@ -75,9 +76,14 @@ install:
 	@test -f build/release/build.ninja || { echo 'make install: nothing is built yet. Run "make build" first.' >&2; exit 1; }
 	cmake --install build/release --prefix '$(PREFIX)'
 
+install-symbols:
+	@test -f build/release/build.ninja || { echo 'make install-symbols: nothing is built yet. Run "make build" first.' >&2; exit 1; }
+	cmake --install build/release --prefix '$(PREFIX)' --component debug
+
 deb: build
 	@packaging/setup deb
 	cd build/release && cpack -G DEB
+	cd build/release && cpack -G DEB --config CPackSymbols.cmake
 
 clean:
 	rm -rf build
