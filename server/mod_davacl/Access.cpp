@@ -4,6 +4,7 @@
 
 #include <fstream>
 #include <sstream>
+#include <sys/stat.h>
 
 namespace rolvane::davacl {
 namespace {
@@ -21,7 +22,11 @@ apr_status_t destroyState(void* state) {
 OwnersLists::Granted grantedBy(request_rec* r, const Configuration& c, const OwnersLists* lists) {
     if (!lists || lists->empty()) return {};
     Caller caller{r->user, {}};
-    if (c.groupFile && lists->mentionsGroups()) caller.groups = groupsOf(r->user, fileText(c.groupFile));
+    if (lists->mentionsGroups()) {
+        const auto groups = c.groupFile ? readableText(c.groupFile) : std::nullopt;
+        caller.groupsKnown = groups.has_value();
+        if (groups) caller.groups = groupsOf(r->user, *groups);
+    }
     return lists->grantedTo(caller);
 }
 
@@ -34,11 +39,18 @@ bool isGranted(request_rec* r, const Configuration& c, const TreePath& place, co
 
 } // namespace
 
-std::string fileText(const char* path) {
+std::optional<std::string> readableText(const char* path) {
     const std::ifstream file(path, std::ios::binary);
     std::ostringstream text;
-    text << file.rdbuf(); // what cannot be read, a directory for instance, is empty
+    if (!file || !(text << file.rdbuf())) { // an empty file, or one that cannot be read, a directory for instance
+        struct stat info {};
+        if (!file || stat(path, &info) != 0 || !S_ISREG(info.st_mode) || info.st_size != 0) return std::nullopt;
+    }
     return text.str();
+}
+
+std::string fileText(const char* path) {
+    return readableText(path).value_or(std::string());
 }
 
 RequestState& stateOf(request_rec* r) {
@@ -92,17 +104,32 @@ Standing standingOf(const request_rec* r) {
     return r->finfo.filetype == APR_DIR ? Standing::collection : Standing::file;
 }
 
+namespace {
+
+std::string escapedPath(request_rec* r, const std::string& path) {
+    return ap_os_escape_path(r->pool, path.c_str(), 1);
+}
+
+std::string hrefTo(request_rec* r, const std::string& urlPath) {
+    return std::string("<D:href>") + apr_xml_quote_string(r->pool, urlPath.c_str(), 0) + "</D:href>";
+}
+
+} // namespace
+
 std::string hrefElement(request_rec* r, const std::string& path) {
-    const char* escaped = ap_os_escape_path(r->pool, path.c_str(), 1);
-    return std::string("<D:href>") + apr_xml_quote_string(r->pool, escaped, 0) + "</D:href>";
+    return hrefTo(r, escapedPath(r, path));
 }
 
 std::string hrefOf(request_rec* r, const Configuration& c, const TreePath& place) {
+    return hrefTo(r, urlPathOf(r, c, place));
+}
+
+std::string urlPathOf(request_rec* r, const Configuration& c, const TreePath& place) {
     std::string path = c.base;
     if (!place.isBase()) path += "/" + place.owner;
     if (!place.below.empty()) path += "/" + place.tree();
     if (place.levels() <= c.levels()) path += "/";
-    return hrefElement(r, path);
+    return escapedPath(r, path);
 }
 
 int refuse(request_rec* r, const Configuration& c, const Missing& missing) {

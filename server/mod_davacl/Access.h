@@ -48,14 +48,17 @@ std::optional<Missing> missingOf(request_rec* r, const Configuration& c, const T
                                  const std::vector<Need>& needs);
 Standing standingOf(const request_rec* r);
 
-// The path of a place as a URL has it, escaped for XML.
+// The path of a place as a URL has it.
+std::string urlPathOf(request_rec* r, const Configuration& c, const TreePath& place);
+// The same as a <D:href>.
 std::string hrefOf(request_rec* r, const Configuration& c, const TreePath& place);
 std::string hrefElement(request_rec* r, const std::string& path); // <D:href>, from a path that is not escaped
 
 // Answers 403 with DAV:need-privileges (RFC 3744 section 7.1.1), or asks whoever is not signed in to do so. What a
 // handler returns then.
 int refuse(request_rec* r, const Configuration& c, const Missing& missing);
-// The text of a file; "" when it cannot be read.
+// The text of a file, nothing or "" when it cannot be read.
+std::optional<std::string> readableText(const char* path);
 std::string fileText(const char* path);
 
 } // namespace rolvane::davacl

@@ -4,6 +4,7 @@
 #include "server/mod_davacl/TreePath.h"
 
 #include <algorithm>
+#include <utility>
 
 namespace rolvane::davacl {
 namespace {
@@ -31,8 +32,14 @@ std::optional<std::string_view> take(std::string_view& rest, char separator) {
     return part;
 }
 
+constexpr std::pair<Principal::Kind, std::string_view> kEverybody[] = {
+    {Principal::Kind::authenticated, "authenticated"},
+    {Principal::Kind::all, "all"},
+    {Principal::Kind::unauthenticated, "unauthenticated"}};
+
 std::optional<Principal> parsePrincipal(std::string_view text) {
-    if (text == "authenticated") return Principal{Principal::Kind::authenticated, {}};
+    for (const auto& [kind, word] : kEverybody)
+        if (text == word) return Principal{kind, {}};
     const auto kind = take(text, ' ');
     if (!kind || (*kind != "user" && *kind != "group")) return std::nullopt;
     auto name = percentDecoded(text);
@@ -41,17 +48,35 @@ std::optional<Principal> parsePrincipal(std::string_view text) {
 }
 
 std::string principalText(const Principal& principal) {
-    if (principal.kind == Principal::Kind::authenticated) return "authenticated";
+    for (const auto& [kind, word] : kEverybody)
+        if (principal.kind == kind) return std::string(word);
     return (principal.kind == Principal::Kind::user ? "user " : "group ") + percentEncoded(principal.name, false);
 }
 
-bool concerns(const Principal& principal, const Caller& caller) {
-    switch (principal.kind) {
-    case Principal::Kind::authenticated: return true;
-    case Principal::Kind::user: return principal.name == caller.name;
-    case Principal::Kind::group: return caller.groups.contains(principal.name);
+bool concerns(const Grant& entry, const Caller& caller) {
+    const std::string& name = entry.principal.name;
+    switch (entry.principal.kind) {
+    case Principal::Kind::authenticated:
+    case Principal::Kind::all: return true;
+    case Principal::Kind::user: return name == caller.name;
+    case Principal::Kind::group: return caller.groupsKnown ? caller.groups.contains(name) : entry.denies;
+    case Principal::Kind::unauthenticated: break;
     }
     return false;
+}
+
+// The first entry counts: what is decided stays so.
+void decide(OwnersLists::Rights& rights, unsigned granted, unsigned denied) {
+    rights.granted |= granted & ~rights.denied;
+    rights.denied |= denied & ~rights.granted;
+}
+
+// The rights of an entry as its line has them, a hyphen in front where it denies.
+std::optional<Grant> parseRights(std::string_view text) {
+    const bool denies = text.starts_with('-');
+    if (denies) text.remove_prefix(1);
+    if (text != "r" && text != "w" && text != "rw") return std::nullopt;
+    return Grant{{}, text != "w", text != "r", denies};
 }
 
 bool isWithin(const std::string& path, const std::string& tree) {
@@ -92,10 +117,10 @@ std::optional<std::string> percentDecoded(std::string_view text) {
 
 void addGrant(AccessList& list, const Grant& grant) {
     if (!grant.read && !grant.write) return;
-    for (Grant& known : list) {
-        if (known.principal != grant.principal) continue;
-        known.read = known.read || grant.read;
-        known.write = known.write || grant.write;
+    for (auto known = list.rbegin(); known != list.rend() && known->denies == grant.denies; ++known) {
+        if (known->principal != grant.principal) continue;
+        known->read = known->read || grant.read;
+        known->write = known->write || grant.write;
         return;
     }
     list.push_back(grant);
@@ -103,7 +128,9 @@ void addGrant(AccessList& list, const Grant& grant) {
 
 std::optional<OwnersLists> OwnersLists::parse(std::string_view text) {
     OwnersLists lists;
-    std::map<std::pair<std::string, Principal>, size_t> places; // of the entry in the list of the tree
+    // Of the last entry of each principal in the list of the tree.
+    std::map<std::pair<std::string, Principal>, size_t> places;
+    std::map<std::string, size_t> runs; // where the entries of the last kind begin in the list of the tree
     if (take(text, '\n') != kFirstLine) return std::nullopt;
     for (;;) {
         auto line = take(text, '\n');
@@ -113,18 +140,20 @@ std::optional<OwnersLists> OwnersLists::parse(std::string_view text) {
         const auto rights = path ? take(*line, ' ') : std::nullopt;
         if (!rights || !path->starts_with('/')) return std::nullopt;
         const auto tree = percentDecoded(path->substr(1));
+        auto grant = parseRights(*rights);
         const auto principal = parsePrincipal(*line);
-        const Grant grant{principal.value_or(Principal()), *rights == "r" || *rights == "rw",
-                          *rights == "w" || *rights == "rw"};
-        if (!tree || !principal || (!grant.read && !grant.write)) return std::nullopt;
+        if (!tree || !principal || !grant) return std::nullopt;
+        grant->principal = *principal;
         AccessList& list = lists._lists[*tree];
+        if (!list.empty() && list.back().denies != grant->denies) runs[*tree] = list.size();
         const auto [known, isNew] = places.try_emplace({*tree, *principal}, list.size());
-        if (isNew) {
-            list.push_back(grant);
+        if (isNew || known->second < runs[*tree]) {
+            known->second = list.size();
+            list.push_back(*grant);
             continue;
         }
-        list[known->second].read |= grant.read;
-        list[known->second].write |= grant.write;
+        list[known->second].read |= grant->read;
+        list[known->second].write |= grant->write;
     }
     if (!text.empty()) return std::nullopt;
     return lists;
@@ -134,8 +163,8 @@ std::string OwnersLists::text() const {
     std::string out = std::string(kFirstLine) + "\n";
     for (const auto& [tree, list] : _lists)
         for (const Grant& grant : list)
-            out += "/" + percentEncoded(tree, true) + " " + (grant.read ? "r" : "") + (grant.write ? "w" : "") + " " +
-                   principalText(grant.principal) + "\n";
+            out += "/" + percentEncoded(tree, true) + (grant.denies ? " -" : " ") + (grant.read ? "r" : "") +
+                   (grant.write ? "w" : "") + " " + principalText(grant.principal) + "\n";
     return out + std::string(kLastLine) + "\n";
 }
 
@@ -180,23 +209,29 @@ OwnersLists::Granted OwnersLists::grantedTo(const Caller& caller) const {
     Granted granted;
     if (caller.name.empty()) return granted;
     for (const auto& [tree, list] : _lists) {
-        unsigned privileges = 0;
-        for (const Grant& grant : list)
-            if (concerns(grant.principal, caller))
-                privileges |= (grant.read ? kReading : 0u) | (grant.write ? kWriting : 0u);
-        if (privileges) granted.emplace(tree, privileges);
+        Rights rights;
+        for (const Grant& grant : list) {
+            if (!concerns(grant, caller)) continue;
+            const unsigned bits = (grant.read ? kReading : 0u) | (grant.write ? kWriting : 0u);
+            decide(rights, grant.denies ? 0 : bits, grant.denies ? bits : 0);
+        }
+        if (rights.granted | rights.denied) granted.emplace(tree, rights);
     }
     return granted;
 }
 
 unsigned OwnersLists::together(const Granted& granted, const std::vector<std::string>& segments) {
-    unsigned privileges = 0;
+    if (granted.empty()) return 0;
+    std::vector<const Rights*> onTheWay;
     std::string tree;
-    for (size_t level = 0; level <= segments.size() && !granted.empty(); ++level) {
+    for (size_t level = 0; level <= segments.size(); ++level) {
         if (level) tree += (level > 1 ? "/" : "") + segments[level - 1];
-        if (const auto found = granted.find(tree); found != granted.end()) privileges |= found->second;
+        if (const auto found = granted.find(tree); found != granted.end()) onTheWay.push_back(&found->second);
     }
-    return privileges;
+    Rights rights;
+    for (auto nearest = onTheWay.rbegin(); nearest != onTheWay.rend(); ++nearest)
+        decide(rights, (*nearest)->granted, (*nearest)->denied);
+    return rights.granted;
 }
 
 } // namespace rolvane::davacl

@@ -10,32 +10,37 @@
 namespace rolvane::davacl {
 
 struct Principal {
-    enum class Kind { user, group, authenticated };
+    enum class Kind { user, group, authenticated, all, unauthenticated };
     Kind kind = Kind::user;
-    std::string name; // "" for authenticated
+    std::string name; // of users and groups, "" for the others
     auto operator<=>(const Principal&) const = default;
 };
 
+// An entry: what it grants to the principal, or denies.
 struct Grant {
     Principal principal;
-    bool read = false, write = false;
+    bool read = false, write = false, denies = false;
     bool operator==(const Grant&) const = default;
 };
 
-// A principal occurs once; the order is that in which they were named.
+// In the order in which they were named, which is the order in which they are looked at (RFC 3744 section 6): of a
+// grant and a denial of one privilege the first counts. Between two entries of the other kind a principal occurs once.
 using AccessList = std::vector<Grant>;
-void addGrant(AccessList& list, const Grant& grant); // joins what is granted to one principal
+void addGrant(AccessList& list, const Grant& grant); // joins it with one that counts at the same time
 
 // Who asks. Nobody is authenticated under an empty name.
 struct Caller {
     std::string name;
     std::set<std::string> groups;
+    bool groupsKnown = true; // else what is denied to a group is denied to everybody
 };
 
 // All the lists of one owner: one for each collection that has one, by its path below the owner's ("" for the owner's
 // root). A plain value. As a text:
 //   file  = "davacl 1" LF *( entry LF ) "end" LF
-//   entry = "/" path SP ( "r" / "w" / "rw" ) SP ( ( "user" / "group" ) SP name / "authenticated" )
+//   entry = "/" path SP [ "-" ] ( "r" / "w" / "rw" ) SP ( ( "user" / "group" ) SP name / everybody )
+//   everybody = "authenticated" / "all" / "unauthenticated"
+// A hyphen: the entry denies.
 // path and name have everything but letters, digits and "-._~@+" (and the slashes of a path) percent-encoded.
 class OwnersLists {
 public:
@@ -53,11 +58,14 @@ public:
     bool empty() const { return _lists.empty(); }
     bool mentionsGroups() const;
 
-    // The privileges that each list grants to the caller, by the list's tree. Every entry is looked at once, however
-    // many places are asked about later.
-    using Granted = std::map<std::string, unsigned, std::less<>>;
+    // The privileges that each list grants to the caller and denies, by the list's tree. Every entry is looked at once,
+    // however many places are asked about later.
+    struct Rights {
+        unsigned granted = 0, denied = 0; // no bit is in both
+    };
+    using Granted = std::map<std::string, Rights, std::less<>>;
     Granted grantedTo(const Caller& caller) const;
-    // What the lists of the places on the way down to the tree grant, together.
+    // What the lists of the places on the way down to the tree grant, together: of two that disagree the nearer counts.
     static unsigned together(const Granted& granted, const std::vector<std::string>& segments);
     unsigned granted(const Caller& caller, const std::vector<std::string>& segments) const {
         return together(grantedTo(caller), segments);

@@ -44,8 +44,9 @@ struct Asked {
 };
 
 std::string entryOf(const std::string& principal, const std::string& privileges, bool isProtected,
-                    const std::string& inheritedFrom) {
-    return "<D:ace><D:principal>" + principal + "</D:principal><D:grant>" + privileges + "</D:grant>" +
+                    const std::string& inheritedFrom, bool denies = false) {
+    const char* kind = denies ? "deny>" : "grant>";
+    return "<D:ace><D:principal>" + principal + "</D:principal><D:" + kind + privileges + "</D:" + kind +
            (isProtected ? "<D:protected/>" : "") +
            (inheritedFrom.empty() ? "" : "<D:inherited>" + inheritedFrom + "</D:inherited>") + "</D:ace>\n";
 }
@@ -58,7 +59,7 @@ std::string entriesOf(const Asked& a, const std::string& tree, const std::string
         text += entryOf(principalElement(a.r, a.c, grant.principal),
                         std::string(grant.read ? "<D:privilege><D:read/></D:privilege>" : "") +
                             (grant.write ? "<D:privilege><D:write/></D:privilege>" : ""),
-                        false, inheritedFrom);
+                        false, inheritedFrom, grant.denies);
     return text;
 }
 
@@ -129,7 +130,7 @@ std::optional<std::string> valueOf(const Asked& a, int property) {
     case kCurrentUserPrivilegeSet:
         if (!(mine & kReadCurrentUserPrivilegeSet)) return std::nullopt;
         return privilegeElements(mine);
-    case kAclRestrictions: return "<D:grant-only/><D:no-invert/>";
+    case kAclRestrictions: return "<D:no-invert/>";
     case kInheritedAclSet: {
         std::string text;
         if (!a.place.isBase())

@@ -73,7 +73,7 @@ class Forfeited {
 public:
     Forfeited(request_rec* r, const Configuration& c, const OwnersLists& lists, const LockDatabase& database)
         : _r(r), _c(c), _lists(lists), _database(database),
-          _groups(c.groupFile ? fileText(c.groupFile) : std::string()) {}
+          _groups(c.groupFile ? readableText(c.groupFile) : std::nullopt) {}
 
     void find(const dav_resource* resource) {
         const auto place = TreePath::of(_c.base, resource->uri);
@@ -93,7 +93,8 @@ public:
 private:
     bool mayHold(const dav_lock& lock, const TreePath& place) const {
         if (!lock.auth_user) return false;
-        const Caller holder{lock.auth_user, groupsOf(lock.auth_user, _groups)};
+        const Caller holder{lock.auth_user, _groups ? groupsOf(lock.auth_user, *_groups) : std::set<std::string>(),
+                            _groups.has_value()};
         return place.owner == holder.name || (_lists.granted(holder, place.below) & kWriteContent);
     }
     bool isKnown(const dav_locktoken* token) const {
@@ -106,7 +107,7 @@ private:
     const Configuration& _c;
     const OwnersLists& _lists;
     const LockDatabase& _database;
-    const std::string _groups;
+    const std::optional<std::string> _groups;  // the group file
     std::vector<const dav_locktoken*> _tokens; // of the request's pool
 };
 

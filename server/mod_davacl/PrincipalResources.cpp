@@ -108,7 +108,7 @@ std::optional<std::string> valueOf(request_rec* r, const Configuration& c, const
     if (name == "current-user-principal") return currentUserPrincipal(r, c);
     if (name == "current-user-privilege-set") return privilegeElements(kReading);
     if (name == "supported-privilege-set") return supportedPrivileges();
-    if (name == "acl-restrictions") return "<D:grant-only/><D:no-invert/>";
+    if (name == "acl-restrictions") return "<D:no-invert/>";
     if (!isPrincipal) return std::nullopt;
     if (name == "displayname") return apr_xml_quote_string(r->pool, place.principal.name.c_str(), 0);
     if (name == "principal-URL") return hrefElement(r, pathOf(c, place));
@@ -249,8 +249,11 @@ std::string principalElement(request_rec* r, const Configuration& c, const Princ
     switch (principal.kind) {
     case Principal::Kind::user: return hrefElement(r, userPath(c, principal.name));
     case Principal::Kind::group: return hrefElement(r, groupPath(c, principal.name));
-    default: return "<D:authenticated/>";
+    case Principal::Kind::all: return "<D:all/>";
+    case Principal::Kind::unauthenticated: return "<D:unauthenticated/>";
+    case Principal::Kind::authenticated: break;
     }
+    return "<D:authenticated/>";
 }
 
 std::string principalCollections(request_rec* r, const Configuration& c) {
@@ -262,7 +265,7 @@ std::string currentUserPrincipal(request_rec* r, const Configuration& c) {
 }
 
 bool exists(request_rec* r, const Configuration& c, const Principal& principal) {
-    if (principal.kind == Principal::Kind::authenticated) return true;
+    if (principal.name.empty()) return true;
     if (principal.kind == Principal::Kind::group) return groupsIn(groupText(c)).contains(principal.name);
     if ((!c.users && !c.userFile) || principal.name == r->user) return true;
     if (c.userFile && usersInFile(r, c).contains(principal.name)) return true;

@@ -73,7 +73,7 @@ TEST_F(AccessLists, ShowTheOwnerTheWholeListAndOthersNothingOfIt) {
     EXPECT_THAT(list, HasSubstr(AccessWorld::ace(AccessWorld::user("walter"), "read write")));
     EXPECT_THAT(list, HasSubstr(AccessWorld::ace(AccessWorld::group("readers"), "read")));
     EXPECT_THAT(list, HasSubstr("<D:owner><D:href>/principals/users/alice</D:href></D:owner>"));
-    EXPECT_THAT(list, HasSubstr("<D:acl-restrictions><D:grant-only/><D:no-invert/></D:acl-restrictions>"));
+    EXPECT_THAT(list, HasSubstr("<D:acl-restrictions><D:no-invert/></D:acl-restrictions>"));
     EXPECT_THAT(list, HasSubstr("<D:inherited-acl-set><D:href>/dav/alice/</D:href></D:inherited-acl-set>"));
     for (const char* user : {"walter", "rita"}) {
         const std::string others = properties(user, kTree, "acl");
@@ -142,16 +142,19 @@ TEST_F(AccessLists, AreSetOnlyWithWhatTheStoreCanKeep) {
         {"a principal by way of dots", W::ace("<D:href>/principals/users/x/../rita</D:href>", "read"), 403,
          "recognized-principal"},
         {"a file for a principal", W::ace("<D:href>/dav/alice/own</D:href>", "read"), 403, "recognized-principal"},
-        {"everybody", W::ace("<D:all/>", "read"), 403, "allowed-principal"},
         {"whoever is not signed in", W::ace("<D:unauthenticated/>", "read"), 403, "allowed-principal"},
         {"oneself", W::ace("<D:self/>", "read"), 403, "allowed-principal"},
         {"an abstract privilege", W::ace(W::user("rita"), "bind"), 403, "no-abstract"},
         {"all privileges", W::ace(W::user("rita"), "all"), 403, "no-abstract"},
         {"an unknown privilege", W::ace(W::user("rita"), "fly"), 403, "not-supported-privilege"},
-        {"a denial",
-         "<D:ace><D:principal>" + W::user("rita") +
+        {"a denial for the owner",
+         "<D:ace><D:principal>" + W::user("alice") +
              "</D:principal><D:deny><D:privilege><D:read/></D:privilege></D:deny></D:ace>",
-         403, "grant-only"},
+         403, "no-protected-ace-conflict"},
+        {"a denial of all privileges",
+         "<D:ace><D:principal>" + W::user("rita") +
+             "</D:principal><D:deny><D:privilege><D:all/></D:privilege></D:deny></D:ace>",
+         403, "no-abstract"},
         {"an inversion",
          "<D:ace><D:invert><D:principal>" + W::user("rita") +
              "</D:principal></D:invert><D:grant><D:privilege><D:read/></D:privilege></D:grant></D:ace>",
