@@ -58,6 +58,11 @@ std::string grantTo(const std::string& href, bool read, bool write) {
     return ace + "</D:grant></D:ace>";
 }
 
+bool deniesEverybody(const CXACE& ace) {
+    return !ace.isGrant() && (ace.isInverted() || ace.principal() == CXACE::Principal::all ||
+                              ace.principal() == CXACE::Principal::authenticated);
+}
+
 // The precondition that the server names (RFC 3744 section 8.1.1), for the log.
 std::string reasonIn(const HttpResponse& answer) {
     const auto root = parseDAVTree(answer.body);
@@ -165,19 +170,41 @@ bool StoreAccessLists::dropUnknown(const Url& name, OnStore& found, std::vector<
            });
 }
 
+// The entries in their order, because the first one that decides counts (RFC 3744 section 6). Those of names stay where
+// they are; new names come last, but before everybody is denied something.
+std::string StoreAccessLists::entriesWith(const OnStore& found, const AccessLists& wanted) const {
+    std::vector<std::string> missing = wanted.readers;
+    for (const std::string& writer : wanted.writers) addIfAbsent(missing, writer);
+    const auto entryFor = [&](const std::string& who) {
+        std::erase(missing, who);
+        return grantTo(found.principals->hrefFor(who).value_or(std::string()), contains(wanted.readers, who),
+                       contains(wanted.writers, who));
+    };
+    std::vector<std::string> entries;
+    std::optional<size_t> end; // where everybody is denied something
+    for (const CXACE& ace : found.entries) {
+        const bool ours = isOurs(found, ace);
+        const std::string name = ours ? found.principals->nameFor(ace.href()) : std::string();
+        if (!end && deniesEverybody(ace)) end = entries.size();
+        if (!ours)
+            entries.push_back(ace.xml());
+        else if (contains(missing, name))
+            entries.push_back(entryFor(name));
+    }
+    std::string added;
+    for (const std::string& who : std::vector<std::string>(missing)) added += entryFor(who);
+    entries.insert(entries.begin() + static_cast<ptrdiff_t>(end.value_or(entries.size())), added);
+    std::string all;
+    for (const std::string& entry : entries) all += entry;
+    return all;
+}
+
 HttpResponse StoreAccessLists::send(OnStore& found, const AccessLists& wanted) {
-    std::string body = "<?xml version=\"1.0\" encoding=\"utf-8\" ?><D:acl xmlns:D=\"DAV:\">";
-    for (const CXACE& ace : found.entries)
-        if (!isOurs(found, ace)) body += ace.xml();
-    std::vector<std::string> names = wanted.readers;
-    for (const std::string& writer : wanted.writers) addIfAbsent(names, writer);
-    for (const std::string& who : names)
-        body += grantTo(found.principals->hrefFor(who).value_or(std::string()), contains(wanted.readers, who),
-                        contains(wanted.writers, who));
-    body += "</D:acl>";
+    const std::string body =
+        "<?xml version=\"1.0\" encoding=\"utf-8\" ?><D:acl xmlns:D=\"DAV:\">" + entriesWith(found, wanted) + "</D:acl>";
     HttpRequest request = StoreSession::request("ACL", found.asked);
     request.headers = {{"Content-Type", "application/xml; charset=utf-8"}};
-    request.body = std::make_shared<const std::string>(std::move(body));
+    request.body = std::make_shared<const std::string>(body);
     return _session.send(std::move(request), [](int) { return true; });
 }
 

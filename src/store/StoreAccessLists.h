@@ -23,8 +23,8 @@ struct AccessLists {
 // Reads and sets the access lists of a store (RFC 3744: the property DAV:acl and the method ACL). Any thread.
 //
 // A list on the store is more than the two lists of names: the owner's own entry, entries for groups or for everybody,
-// denials. All those stay as they are. Ours are the grants of plain reading and writing to single principals other than
-// the owner; those are replaced.
+// denials. All those stay as they are and in their order. Ours are the grants of plain reading and writing to single
+// principals other than the owner; those are replaced.
 //
 // Several programs of one owner may set one list. So a list that this client has seen is changed by what the caller
 // changed since then, and what others changed meanwhile stays; and a list that the caller did not change is not sent.
@@ -50,6 +50,7 @@ private:
     AccessLists listsOf(const OnStore& found) const;
     bool isOurs(const OnStore& found, const CXACE& ace) const;
     static bool dropUnknown(const Url& name, OnStore& found, std::vector<std::string>& list);
+    std::string entriesWith(const OnStore& found, const AccessLists& wanted) const;
     HttpResponse send(OnStore& found, const AccessLists& wanted);
     bool sendOrInherit(const Url& name, OnStore& found, const AccessLists& wanted);
 

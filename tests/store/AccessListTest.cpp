@@ -315,6 +315,29 @@ TEST_F(StoreLists, EntriesOfOthersKindsStayAsTheyAre) {
     EXPECT_EQ(store.lists(), "r carl; w");
 }
 
+TEST_F(StoreLists, TheOrderOfEntriesStaysBecauseTheFirstThatDecidesCounts) {
+    const std::string denyAll =
+        "<D:ace><D:principal><D:all/></D:principal><D:deny>" + privilege("read") + "</D:deny></D:ace>";
+    const std::string denyStaff = "<D:ace><D:principal><D:href>/principals/staff</D:href></D:principal><D:deny>" +
+                                  privilege("read") + "</D:deny></D:ace>";
+    const auto order = [this] {
+        std::string names;
+        for (const std::string& entry : store.entries)
+            for (const char* name : {"bob", "carl", "staff", "D:all"})
+                if (entry.find(name) != std::string::npos) names += (names.empty() ? "" : " ") + std::string(name);
+        return names;
+    };
+    store.entries = {AclStore::ace("/principals/bob", {"read"}), denyStaff, denyAll};
+    ASSERT_EQ(read(), "r bob; w");
+    EXPECT_TRUE(set({"bob", "carl"}, {}));
+    EXPECT_EQ(order(), "bob staff carl D:all") << "whom all are denied for stands before that";
+    EXPECT_TRUE(set({"bob", "carl"}, {"bob"}));
+    EXPECT_EQ(order(), "bob staff carl D:all");
+    EXPECT_EQ(store.lists(), "r bob carl; w bob");
+    EXPECT_TRUE(set({"carl"}, {}));
+    EXPECT_EQ(order(), "staff carl D:all");
+}
+
 TEST_F(StoreLists, TheServersOwnEntriesAreNotSentBack) {
     set({"bob"}, {});
     EXPECT_EQ(store.bodies.back().find("protected"), std::string::npos);
