@@ -1,15 +1,16 @@
 #include "ElfFile.h"
 
 #include <cstring>
+#include <filesystem>
 #include <fstream>
-#include <iterator>
 #include <stdexcept>
 
 namespace rolvane::test {
 
 ElfFile::ElfFile(const std::string& path) {
     std::ifstream file(path, std::ios::binary);
-    _bytes.assign(std::istreambuf_iterator<char>(file), {});
+    _bytes.resize(std::filesystem::file_size(path));
+    file.read(_bytes.data(), static_cast<std::streamsize>(_bytes.size()));
     if (_bytes.size() < sizeof _header || _bytes.compare(0, SELFMAG, ELFMAG) != 0 || _bytes[EI_CLASS] != ELFCLASS64)
         throw std::runtime_error(path + " is no ELF file of 64 bits");
     std::memcpy(&_header, _bytes.data(), sizeof _header);
