@@ -115,26 +115,33 @@ void takeInWhatWasWritten(Context& context, double seconds) {
     }
 }
 
-// Has the daemon carry the lists to the store, and tells whether they are there.
-void carry(Context& context, PassWatch& watch, const ShareOptions& options, const Url& base) {
+// Has the daemon carry the lists to the store, and tells whether they are there. The outcome of the pass that did it;
+// nothing where nobody waits for one.
+std::optional<PassOutcome> carry(Context& context, PassWatch& watch, const ShareOptions& options, const Url& base) {
     CXRolvane& database = context.database();
     const int64_t position = database.journalPosition();
     OutcomeWatch outcomes(context);
     const DaemonControl daemon;
     if (!daemon.start() && !watch.tell(kAllACLChanged).value_or(false)) daemon.restart();
-    if (options.noWait) return;
+    if (options.noWait) return std::nullopt;
     PassOutcome outcome = waitForPass(context, watch, outcomes, "Sharing", position, options.timeout);
     const Shares shares(database);
     const auto agrees = [&] {
         const auto lists = storeLists(base);
         return lists && same(lists->rightsOf(options.user), rightsHere(shares, options.user));
     };
-    if (agrees()) return context.say("The store has it.");
-    if (outcome.storeReached && isComplete(outcome)) outcome = makePass(context, options.timeout);
-    if (agrees()) return context.say("The store has it.");
+    bool done = agrees();
+    if (!done && outcome.storeReached && isComplete(outcome)) {
+        outcome = makePass(context, options.timeout);
+        done = agrees();
+    }
+    if (done) {
+        context.say("The store has it.");
+        return outcome;
+    }
     const PassTree* own = outcome.tree(kSelf);
     const bool toldWhy = !outcome.storeReached || !isComplete(outcome) || !own || own->ended || own->out.why;
-    if (toldWhy && !report(context, outcome, {}, true)) return;
+    if (toldWhy && !report(context, outcome, {}, true)) return outcome;
     throw CommandError(kFailed, fmt::format("The store did not take it. Perhaps it knows no user \"{0}\": check the "
                                             "name, and take it back with `rolvane unshare {0}`.",
                                             options.user));
@@ -166,8 +173,8 @@ void changeShares(Context& context, const ShareOptions& options, bool grant) {
     PassWatch watch(context, !context.quiet);
     const bool hadWriters = !writers.empty();
     grant ? shares.grant(user, options.write) : shares.deny(user);
-    // What writers send is taken only by a daemon that knew of one when it started. It rests before the lists are
-    // saved: ended later, it would be in the middle of carrying them.
+    // Only a daemon that knew of a writer when it started takes in changes that writers send. It rests before the
+    // lists are saved: ended later, it would be in the middle of carrying them.
     if (hadWriters == shares.writers().empty()) {
         const DaemonControl daemon;
         const bool ran = daemon.stop();
@@ -184,8 +191,9 @@ void changeShares(Context& context, const ShareOptions& options, bool grant) {
     context.say(!grant          ? fmt::format("\"{}\" may no longer read your contacts.", user)
                 : options.write ? fmt::format("\"{}\" may read and change your contacts.", user)
                                 : fmt::format("\"{}\" may read your contacts, not change them.", user));
-    if (!options.noDaemon) carry(context, watch, options, base);
-    if (context.json) context.print({{"user", user}, {"rights", orNull(rightsHere(shares, user))}});
+    const auto outcome = options.noDaemon ? std::nullopt : carry(context, watch, options, base);
+    if (context.json)
+        context.print({{"user", user}, {"rights", orNull(rightsHere(shares, user))}, {"pass", outcomeJson(outcome)}});
 }
 
 // shares -----------------------------------------------------------------------------------------------------------

@@ -128,6 +128,10 @@ void unpublishAtRest(Context& context, const PublishOptions& options, const CXGr
         throw notRemoved(*failure, fmt::format("{}, but {} could not be removed from the store ({}). Run the command "
                                                "again when the store can be reached; nothing else was lost.",
                                                done, failure->what, failure->answer()));
+    if (context.json)
+        context.print({{"group", group ? nlohmann::ordered_json(group->name()) : nlohmann::ordered_json()},
+                       {"stillPublished", publication.anything()},
+                       {"removedFromStore", removes}});
     context.say(done + (wholeListStays ? " by itself; it stays on the store as part of the contact list."
                         : removes      ? ", and its files are off the store."
                                        : "."));

@@ -111,7 +111,8 @@ void waitForPeople(Context& context, PassWatch& watch, OutcomeWatch& outcomes, c
                                                  user));
     if (!cameWhole()) context.warn(fmt::format("Not all contacts of \"{}\" have come yet.", user));
     const bool well = report(context, outcome, {});
-    const Json data = described(database, subscription);
+    Json data = described(database, subscription);
+    data["pass"] = outcomeJson(outcome);
     if (context.json) context.print(data);
     if (well && cameWhole())
         context.say(fmt::format("{} of \"{}\" are here; you may {}.", amount(data), user,

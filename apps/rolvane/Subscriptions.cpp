@@ -110,8 +110,9 @@ bool wasRead(Preferences& preferences, const RemoteLocation& location) {
 size_t pendingFor(Preferences& preferences, const RemoteLocation& location) {
     const UserName user(publisherOf(location));
     const CXDChangeRecords waiting = EngineState(preferences).getPendingChanges();
-    return static_cast<size_t>(std::count_if(waiting.begin(), waiting.end(),
-                                             [&](const CXDChangeRecordPtr& record) { return record->user() == user; }));
+    return static_cast<size_t>(std::count_if(waiting.begin(), waiting.end(), [&](const CXDChangeRecordPtr& record) {
+        return record->user() == user && (record->appliesToSources() & CXDSyncSourceVaultra) != 0;
+    }));
 }
 
 void forgetSubscription(Preferences& preferences, const RemoteLocation& location, const UniqueId& subscription) {

@@ -41,7 +41,11 @@ protected:
 TEST_F(Rights, AreGrantedLoweredAndTakenBackAndTheStoreHasThemWhenTheCommandReturns) {
     world.done({"publish"});
     EXPECT_EQ(world.json({"shares"}), nlohmann::json::array());
-    EXPECT_EQ(world.json({"share", "bob"}), (nlohmann::json{{"user", "bob"}, {"rights", "read"}}));
+    const auto told = world.json({"share", "bob"});
+    EXPECT_EQ(told["user"], "bob");
+    EXPECT_EQ(told["rights"], "read");
+    EXPECT_EQ(told["pass"]["storeReached"], true);
+    EXPECT_EQ(told["pass"]["trees"][0]["own"], true);
     EXPECT_EQ(shares(), nlohmann::json::array({share("bob", "read")}));
     EXPECT_EQ(bob.json({"rights", "alice"})["read"], true);
     EXPECT_EQ(bob.json({"rights", "alice"})["write"], false);

@@ -49,6 +49,15 @@ protected:
     CommandWorld world;
 };
 
+TEST_F(Withdrawing, IsToldAsADocument) {
+    publishTwoGroups();
+    EXPECT_EQ(world.json({"unpublish", "--group", "Work"}),
+              (nlohmann::json{{"group", "Work"}, {"stillPublished", true}, {"removedFromStore", true}}));
+    EXPECT_EQ(world.json({"unpublish", "--keep"}),
+              (nlohmann::json{{"group", nullptr}, {"stillPublished", false}, {"removedFromStore", false}}));
+    EXPECT_FALSE(world.tree().empty());
+}
+
 TEST_F(Withdrawing, ThatFailsInTheMiddleIsFinishedByTheNextPublication) {
     world.done({"publish"});
     storeFailsAt("tree");
