@@ -29,6 +29,13 @@ TransportError translated(CURLcode code) {
     }
 }
 
+std::string reason(CURLcode code, const HttpJob& job) {
+    const std::string* encoding = job.response.header("content-encoding");
+    if (code == CURLE_BAD_CONTENT_ENCODING && encoding)
+        return "The answer came encoded as \"" + *encoding + "\", which nobody asked for and which cannot be read.";
+    return curl_easy_strerror(code);
+}
+
 bool wantsDigest(const HttpResponse& answer) {
     bool digest = false;
     for (const auto& [name, value] : answer.headers) {

@@ -13,6 +13,8 @@ namespace rolvane {
 TransportError translated(CURLcode code);
 // Whether a kept connection has failed the job of the slot, so that a new one may serve it.
 bool needsNewConnection(const CurlSlot& slot, CURLcode code);
+// Why a transfer that ended with the code failed, for a person.
+std::string reason(CURLcode code, const HttpJob& job);
 // True when the answer asks for Digest and does not take Basic.
 bool wantsDigest(const HttpResponse& answer);
 // Why a request cannot be sent as it stands, or "".

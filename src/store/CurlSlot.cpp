@@ -70,6 +70,8 @@ CurlSlot::CurlSlot(const CurlTransportOptions& options) : _easy(curl_easy_init()
     curl_easy_setopt(_easy, CURLOPT_FOLLOWLOCATION, 0L);
     curl_easy_setopt(_easy, CURLOPT_PROTOCOLS_STR, "http,https");
     curl_easy_setopt(_easy, CURLOPT_PATH_AS_IS, 1L);
+    // Nobody asks for a compressed answer (setHeaders); one that comes all the same is decoded, within the limits.
+    curl_easy_setopt(_easy, CURLOPT_ACCEPT_ENCODING, "");
     curl_easy_setopt(_easy, CURLOPT_TCP_NODELAY, 1L);
     curl_easy_setopt(_easy, CURLOPT_TCP_KEEPALIVE, 1L);
     curl_easy_setopt(_easy, CURLOPT_CONNECTTIMEOUT_MS, 15000L);
@@ -144,6 +146,7 @@ void CurlSlot::setHeaders() {
     }
     add("Accept:");
     add("Expect:");
+    add("Accept-Encoding:");
     if (!hasType) add("Content-Type:");
     _headersShown = wanted;
     curl_easy_setopt(_easy, CURLOPT_HTTPHEADER, _headers);

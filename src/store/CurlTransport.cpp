@@ -352,7 +352,7 @@ void CurlTransport::Impl::finished(CurlSlot& slot, CURLcode code) {
     const bool refusedEarly = code == CURLE_HTTP2_STREAM && job->headerDone && job->response.status >= 400;
     if (code != CURLE_OK && !refusedEarly) {
         const TransportError error = job->verdict != TransportError::none ? job->verdict : translated(code);
-        const std::string detail = job->verdict != TransportError::none ? job->verdictDetail : curl_easy_strerror(code);
+        const std::string detail = job->verdict != TransportError::none ? job->verdictDetail : reason(code, *job);
         return fail(std::move(job), error, detail);
     }
     if (!job->headerDone)
@@ -443,6 +443,7 @@ void CurlTransport::Impl::fail(std::unique_ptr<HttpJob> job, TransportError erro
     HttpResponse answer;
     answer.error = error;
     answer.detail = std::move(detail);
+    if (job->headerDone) answer.headers = std::move(job->response.headers);
     job->done(std::move(answer));
 }
 

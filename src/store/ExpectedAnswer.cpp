@@ -1,5 +1,6 @@
 #include "store/ExpectedAnswer.h"
 
+#include "store/Multistatus.h"
 #include "store/StoreSession.h"
 
 #include <algorithm>
@@ -72,13 +73,32 @@ AnswerVerdict onLock(const HttpResponse& answer) {
     return grants && !isWebPage(answer) ? AnswerVerdict::success : AnswerVerdict::foreign;
 }
 
+AnswerVerdict onPropfind(const HttpResponse& answer) {
+    const bool hasBody = answer.status == 207 || (answer.status == 200 && containsNoCase(answer.body, "multistatus"));
+    return hasBody && !isWebPage(answer) ? AnswerVerdict::success : AnswerVerdict::foreign;
+}
+
 // `done`: the statuses that say so beyond doubt.
 AnswerVerdict onWrite(int status, std::initializer_list<int> done, AnswerVerdict otherwise) {
     if (status == 207) return AnswerVerdict::failure;
     return std::find(done.begin(), done.end(), status) != done.end() ? AnswerVerdict::success : otherwise;
 }
 
+AnswerVerdict onDelete(const HttpResponse& answer) {
+    if (answer.status == 207 && namesNoFailure(answer)) return AnswerVerdict::success;
+    return onWrite(answer.status, {204}, AnswerVerdict::needsProof);
+}
+
 } // namespace
+
+bool namesNoFailure(const HttpResponse& multistatus) {
+    MultistatusReader reader;
+    const auto entries = reader.feed(multistatus.body) ? reader.finish() : std::nullopt;
+    return entries && !entries->empty() &&
+           std::all_of(entries->begin(), entries->end(), [](const MultistatusEntry& entry) {
+               return (entry.status >= 200 && entry.status < 300) || entry.status == 404;
+           });
+}
 
 bool isWebPage(const HttpResponse& answer) {
     if (const std::string* type = answer.header("content-type"); type && !type->empty())
@@ -92,11 +112,11 @@ AnswerVerdict verdictOn(std::string_view method, const HttpResponse& answer) {
     if (status < 200) return AnswerVerdict::foreign;
     if (status >= 300) return onError(methodOf(method), status);
     switch (methodOf(method)) {
-    case Method::options: return announcesDav1(answer) ? AnswerVerdict::success : AnswerVerdict::foreign;
-    case Method::propfind: return status == 207 && !isWebPage(answer) ? AnswerVerdict::success : AnswerVerdict::foreign;
+    case Method::options: return announcesDav(answer) ? AnswerVerdict::success : AnswerVerdict::foreign;
+    case Method::propfind: return onPropfind(answer);
     case Method::read: return onRead(answer);
     case Method::put: return onWrite(status, {201, 204}, AnswerVerdict::needsProof);
-    case Method::remove: return onWrite(status, {204}, AnswerVerdict::needsProof);
+    case Method::remove: return onDelete(answer);
     case Method::mkcol: return onWrite(status, {201}, AnswerVerdict::needsProof);
     case Method::transfer: return onWrite(status, {201, 204}, AnswerVerdict::foreign);
     case Method::lock: return onLock(answer);

@@ -11,11 +11,13 @@ namespace rolvane {
 // what they say must neither count as written nor as refused.
 //
 //   method     success                     needs proof                      everything else with 2xx
-//   OPTIONS    "DAV: 1" in the header      -                                foreign
-//   PROPFIND   207, no web page            -                                foreign
+//   OPTIONS    a DAV class in the header   -                                foreign
+//   PROPFIND   207, no web page;           -                                foreign
+//              200 with a multistatus
 //   GET, HEAD  200, no web page            200 with a web page              foreign
 //   PUT        201, 204                    200, 202 and others              207 fails
-//   DELETE     204                         200, 202 and others              207 fails
+//   DELETE     204; 207 that names no      200, 202 and others              any other 207 fails
+//              failure
 //   MKCOL      201                         200, 204 and others              207 fails
 //   COPY, MOVE 201, 204                    -                                207 fails, else foreign
 //   LOCK       200, 201 with activelock    -                                foreign
@@ -35,6 +37,9 @@ enum class AnswerVerdict {
     foreign,      // no WebDAV server answers so: the store was not reached
 };
 AnswerVerdict verdictOn(std::string_view method, const HttpResponse& answer);
+
+// Whether the body of an answer with 207 says of everything that it names that it is done, or was not there.
+bool namesNoFailure(const HttpResponse& multistatus);
 
 // Whether the answer carries a page for people: by its content type, or by how it begins where it has none.
 bool isWebPage(const HttpResponse& answer);

@@ -56,7 +56,8 @@ struct HttpResponse {
     TransportError error = TransportError::none;
     std::string detail;                                       // for people, when error is not none
     int status = 0;                                           // 0 when error is not none
-    std::vector<std::pair<std::string, std::string>> headers; // of the final answer, names in lower case
+    std::vector<std::pair<std::string, std::string>> headers; // of the final answer, names in lower case;
+                                                              // also of one whose body failed
     std::string body;
 
     bool complete() const { return error == TransportError::none; }

@@ -26,6 +26,12 @@ std::optional<uint64_t> parsedNumber(std::string_view text) {
     return n;
 }
 
+// As the standard has it, or as some servers write it.
+std::optional<Date> parsedDate(const std::string& text) {
+    const auto date = Date::fromHTTP(text);
+    return date ? date : Date::fromISO8601(text);
+}
+
 // "HTTP/1.1 200 OK" -> 200
 int parsedStatus(const std::string& line) {
     const size_t space = line.find(' ');
@@ -45,6 +51,7 @@ struct MultistatusReader::Impl : XmlSax {
     MultistatusEntry offered; // what the propstat under way offers
     int propstatStatus = 0;
     bool rootSeen = false, hrefSeen = false;
+    bool statusSeen = false; // of the propstat under way
     std::string gathered;
 
     bool opened(const std::vector<std::string>& path) override {
@@ -56,6 +63,7 @@ struct MultistatusReader::Impl : XmlSax {
         } else if (path.size() == 3 && path[2] == "propstat") {
             offered = {};
             propstatStatus = 0;
+            statusSeen = false;
         } else if (path.size() == 6 && path[4] == "resourcetype" && path[5] == "collection") {
             offered.isCollection = true;
         }
@@ -74,7 +82,10 @@ struct MultistatusReader::Impl : XmlSax {
         if (path.size() == 2) return closedResponse();
         if (path.size() == 3) return closedInResponse(path[2], content);
         if (path[2] != "propstat") return true;
-        if (path.size() == 4 && path[3] == "status") propstatStatus = parsedStatus(content);
+        if (path.size() == 4 && path[3] == "status") {
+            propstatStatus = parsedStatus(content);
+            statusSeen = true;
+        }
         if (path.size() == 5 && path[3] == "prop") closedProperty(path[4], content);
         return true;
     }
@@ -91,14 +102,14 @@ struct MultistatusReader::Impl : XmlSax {
             hrefSeen = true;
         } else if (name == "status") {
             entry.status = parsedStatus(content);
-        } else if (name == "propstat" && propstatStatus == 200) {
+        } else if (name == "propstat" && (propstatStatus == 200 || !statusSeen)) {
             takeOffered();
         }
         return true;
     }
 
     void closedProperty(const std::string& name, const std::string& content) {
-        if (name == "getlastmodified") offered.lastModified = Date::fromHTTP(content);
+        if (name == "getlastmodified") offered.lastModified = parsedDate(content);
         if (name == "getcontentlength") offered.length = parsedNumber(content);
         if (name == "getetag") offered.etag = EntityTag(content);
         if (name == kMembersTag) offered.membersTag = content;

@@ -12,12 +12,12 @@
 namespace rolvane {
 
 // One `response` of a multistatus body (RFC 4918 section 14.24), with the properties that a listing asks for.
-// Properties are taken from propstats of status 200 only.
+// Properties are taken from propstats of status 200 only, and from those that say no status.
 struct MultistatusEntry {
     std::string href; // as the server wrote it, surrounding white space dropped
     int status = 0;   // the response's own status, 0 when it has propstats instead
     bool isCollection = false;
-    std::optional<Date> lastModified;
+    std::optional<Date> lastModified; // of RFC 9110 section 5.6.7, or RFC 3339
     std::optional<uint64_t> length;
     EntityTag etag;
     std::string membersTag; // of a collection, on a store that gives one (StoreSession::givesMembersTags)
@@ -29,8 +29,8 @@ struct MultistatusLimits {
     size_t maxText = 16384; // of one href or property
 };
 
-// Reads a multistatus body piece by piece (libxml2 SAX; no DTD, no entities of the document's own, no network). What
-// it has read counts only when `finish` says so: a truncated body is nothing. One thread.
+// Reads a multistatus body piece by piece (libxml2 SAX; no declarations or entities of the document's own, no network).
+// What it has read counts only when `finish` says so: a truncated body is nothing. One thread.
 class MultistatusReader {
 public:
     explicit MultistatusReader(MultistatusLimits limits = {});

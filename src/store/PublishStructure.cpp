@@ -125,10 +125,26 @@ HttpRequest PublishStructure::writingNew(const Url& name, const std::string& tex
 
 // All at once. What exists already (405 and 412), because somebody else makes the structure too, is as good.
 bool PublishStructure::makeAll(std::vector<HttpRequest> requests) {
+    const std::vector<HttpRequest> asked = requests;
     const auto isThere = [](int status) { return status == 405 || status == 412; };
-    const auto answers = _session.sendAll(std::move(requests), isThere);
-    return std::all_of(answers.begin(), answers.end(),
-                       [&](const HttpResponse& answer) { return answer.ok() || isThere(answer.status); });
+    const auto answers = _session.sendAll(std::move(requests),
+                                          [](int status) { return status == 405 || status == 412 || status == 501; });
+    bool all = true;
+    for (size_t i = 0; i < answers.size(); ++i) {
+        if (answers[i].ok() || isThere(answers[i].status) || writtenWithoutCondition(asked[i], answers[i])) continue;
+        if (answers[i].status == 501) _session.noteFailure(asked[i].method, asked[i].url, answers[i]);
+        all = false;
+    }
+    return all;
+}
+
+// A server that knows no "If-None-Match: *" is asked first whether the file is there.
+bool PublishStructure::writtenWithoutCondition(HttpRequest request, const HttpResponse& answer) {
+    if (request.method != "PUT" || answer.status != 501) return false;
+    const int found = _session.send(StoreSession::request("GET", request.url), [](int s) { return s == 404; }).status;
+    if (found != 404) return found == 200;
+    std::erase_if(request.headers, [](const auto& header) { return header.first == "If-None-Match"; });
+    return _session.send(std::move(request)).ok();
 }
 
 bool PublishStructure::complete(const Missing& missing) {

@@ -36,6 +36,7 @@ private:
     HttpRequest making(const Url& collection) const;
     HttpRequest writingNew(const Url& name, const std::string& text) const;
     bool makeAll(std::vector<HttpRequest> requests);
+    bool writtenWithoutCondition(HttpRequest request, const HttpResponse& answer);
     Url base() const { return _session.account().baseLocationFor(_session.account().user); }
 
     StoreSession& _session;

@@ -55,12 +55,24 @@ bool isHtml(const HttpResponse& answer) {
     return type && type->find("html") != std::string::npos;
 }
 
+std::optional<Date> dateIn(const HttpResponse& answer, const char* name) {
+    const std::string* text = answer.header(name);
+    return text ? Date::fromHTTP(*text) : std::nullopt;
+}
+
 FileVersion versionOf(const HttpResponse& answer) {
     FileVersion v;
     if (const std::string* tag = answer.header("etag")) v.etag = EntityTag(*tag);
-    if (const std::string* date = answer.header("last-modified")) v.lastModified = Date::fromHTTP(*date);
+    v.lastModified = dateIn(answer, "last-modified");
     v.size = answer.body.size();
     return v;
+}
+
+bool isOneVersion(const EntityTag& a, const EntityTag& b) {
+    const auto opaque = [](const EntityTag& tag) {
+        return std::string_view(tag.str()).substr(tag.str().starts_with("W/") ? 2 : 0);
+    };
+    return !a.empty() && opaque(a) == opaque(b);
 }
 
 // A condition on this resource and no other: a list without a tag would be asked of the parent folder too.
@@ -103,6 +115,10 @@ bool isInTheWay(int status) {
 // To what was named as a collection and is none, or the other way round.
 bool mayMeanAnother(int status) {
     return isInTheWay(status);
+}
+// That it does not hold, that it makes no sense, or that the server does not know its like.
+bool mayMeanTheCondition(int status) {
+    return status == 412 || status == 400 || status == 501;
 }
 bool isGoneOrChanged(int status) {
     return status == 404 || status == 412;
@@ -306,13 +322,16 @@ std::optional<Date> StoreFiles::modificationDate(const Url& name) {
     const Url target = mayBeBoth(name) && knownCollection(*url) ? stateURL(*url) : *url;
     const HttpResponse answer = _session.send(StoreSession::request("HEAD", target), isAny);
     if (answer.ok())
-        if (const std::string* date = answer.header("last-modified")) return Date::fromHTTP(*date);
+        if (const auto date = dateIn(answer, "last-modified")) return date;
     if (!answer.complete() || answer.status == 404) return std::nullopt;
     MultistatusReader reader;
     const HttpResponse found = _session.send(StoreSession::propfind(target, 0), isAbsence);
     if (found.status != 207 || !reader.feed(found.body)) return std::nullopt;
     const auto entries = reader.finish();
-    return entries && entries->size() == 1 ? entries->front().lastModified : std::nullopt;
+    if (!entries || entries->size() != 1) return std::nullopt;
+    if (entries->front().lastModified) return entries->front().lastModified;
+    const auto told = dateIn(found, "date");
+    return told ? told : Clock::system().now();
 }
 
 // ---- writing
@@ -348,12 +367,19 @@ void StoreFiles::noteWritten(const Url& name, const HttpResponse& answer, const 
     if (mayBeBoth(name)) keepWritten(name, text);
 }
 
-// A write whose answer was lost on the way is sent again, and then meets its own version.
-bool StoreFiles::isWritten(const Url& name, const Url& target, const std::string& text) {
+// After a conditional write that was refused. One whose answer was lost on the way is sent again, and then meets its
+// own version; and some servers get conditions wrong, or do not know them, whatever lies there.
+StoreFiles::Standing StoreFiles::standing(const Url& name, const Url& target, const std::string& text,
+                                          const FileCondition& condition) {
     const HttpResponse there = _session.send(StoreSession::request("GET", target), isAny);
-    if (there.status != kOk || there.body != text) return false;
-    noteWritten(name, there, text);
-    return true;
+    if (there.status == 404) return condition.isAbsent ? Standing::asKnown : Standing::other;
+    if (there.status != kOk) return Standing::other;
+    if (there.body == text) {
+        noteWritten(name, there, text);
+        return Standing::written;
+    }
+    const bool isKnown = !condition.isAbsent && isOneVersion(condition.etag, versionOf(there).etag);
+    return isKnown ? Standing::asKnown : Standing::other;
 }
 
 int StoreFiles::write(const Url& name, std::string text, bool securely, const std::function<bool()>& repair) {
@@ -367,9 +393,14 @@ int StoreFiles::write(const Url& name, std::string text, bool securely, const st
     const auto body = std::make_shared<const std::string>(std::move(text));
     HttpResponse answer;
     const auto attempt = [&](const Url& target) {
-        answer = put(name, target, body, conditions(mark, _tokens.tokenFor(target.absoluteString()), target));
-        const bool hasMetItself = answer.status == 412 && mark.set && isWritten(name, target, *body);
-        if (hasMetItself) answer.status = kNoContent;
+        const LockToken token = _tokens.tokenFor(target.absoluteString());
+        answer = put(name, target, body, conditions(mark, token, target));
+        if (!mark.set || !mayMeanTheCondition(answer.status)) return answer.status;
+        switch (standing(name, target, *body, {mark.state == ReadMark::State::absent, mark.etag})) {
+        case Standing::written: answer.status = kNoContent; break;
+        case Standing::asKnown: answer = put(name, target, body, conditions({}, token, target)); break; // by the lock
+        case Standing::other: break;
+        }
         return answer.status;
     };
     const auto last = [&](int status) {
@@ -467,10 +498,19 @@ bool StoreFiles::moveIntoCollection(const Url& url, const EntityTag& tag) {
     if (!_session.send(std::move(copy)).ok()) return false;
     HttpRequest move = StoreSession::request("MOVE", collection);
     move.headers = {{"Destination", url.absoluteString()}, {"Overwrite", "T"}};
+    const HttpRequest unconditional = move;
     if (!tag.empty()) move.headers.emplace_back("If", taggedCondition(url, "[" + tag.str() + "]"));
-    const HttpResponse moved = _session.send(std::move(move), isGoneOrChanged);
+    HttpResponse moved = _session.send(std::move(move), isAny);
+    if (moved.ok()) return true;
+    EntityTag now;
+    const Kind kind =
+        isGoneOrChanged(moved.status) || mayMeanTheCondition(moved.status) ? kindOf(url, &now) : Kind::unknown;
     // One that was sent again because its answer was lost finds the collection in its place.
-    if (moved.ok() || (isGoneOrChanged(moved.status) && kindOf(url) == Kind::collection)) return true;
+    if (kind == Kind::collection) return true;
+    if (kind == Kind::file && mayMeanTheCondition(moved.status) && isOneVersion(tag, now)) {
+        moved = _session.send(unconditional, isAny); // the server gets the condition wrong
+        if (moved.ok()) return true;
+    }
     _session.noteFailure("MOVE", url, moved);
     return false;
 }

@@ -20,7 +20,8 @@ namespace rolvane {
 // Reads, writes and removes the files of a store, names in, HTTP status codes out (0: no believable answer).
 // Resolves paths that are a group's state file and its directory at once, and makes the write that follows a read
 // conditional. A conditional write that fails with 412 while the store holds just what was to be written has succeeded:
-// its answer was lost and it was sent again. Any thread.
+// its answer was lost and it was sent again. One that fails although the store holds the very version that it named has
+// met a server that gets conditions wrong, or knows none: it goes out without, under the lock of the tree. Any thread.
 class StoreFiles {
 public:
     StoreFiles(StoreSession& session, LockTokens& tokens, VersionMemory& versions);
@@ -72,7 +73,12 @@ private:
     void keepWritten(const Url& name, const std::string& text);
     HttpResponse put(const Url& name, const Url& target, const std::shared_ptr<const std::string>& body,
                      std::vector<std::pair<std::string, std::string>> headers);
-    bool isWritten(const Url& name, const Url& target, const std::string& text);
+    struct FileCondition {
+        bool isAbsent = false;
+        EntityTag etag;
+    };
+    enum class Standing { written, asKnown, other }; // what was to be written, what the condition named, neither
+    Standing standing(const Url& name, const Url& target, const std::string& text, const FileCondition& condition);
     void noteWritten(const Url& name, const HttpResponse& answer, const std::string& text);
     enum class Kind { absent, file, collection, unknown };
     Kind kindOf(const Url& url, EntityTag* tag = nullptr);

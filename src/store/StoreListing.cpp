@@ -1,6 +1,7 @@
 #include "store/StoreListing.h"
 
 #include "foundation/Log.h"
+#include "store/Collections.h"
 #include "store/StoreFiles.h"
 
 #include <algorithm>
@@ -33,6 +34,14 @@ bool isMember(const Url& name, const Url& container) {
 
 std::string pathOf(const Url& name) {
     return name.path();
+}
+
+// The path of an href that is a URL of its own: behind a proxy servers write another scheme, host or port than the
+// client's. Where nothing is sent, the path alone counts.
+std::string pathIn(const std::string& href) {
+    const auto url = href.starts_with('/') ? std::nullopt : Url::parse(href);
+    const bool isPlain = url && href.find_first_of("?#") == std::string::npos;
+    return isPlain ? url->encodedPath() : href;
 }
 
 bool isBaseLocation(const Url& name) {
@@ -96,16 +105,18 @@ StoreListing::Members StoreListing::read(Asked& asked, size_t number) {
     const auto staged = std::move(asked.staged[number]);
     out.code = answer.status;
     out.serverDate = serverDateOf(answer);
-    if (answer.status != 207 || !staged->sound) return out;
+    // What came under another status is here; a body of 207 has been read.
+    if (answer.status != 207 || !staged->sound || !staged->reader.feed(answer.body)) return out;
     const auto entries = staged->reader.finish();
-    if (!entries || entries->empty()) return out; // even an empty container names itself
+    if (!entries) return out;
     const Url container = *_session.nameFor(place.absoluteString());
     std::vector<std::pair<Url, MultistatusEntry>> inside;
-    bool namesItself = false, whole = true;
+    bool isNamed = false, isCollection = false, whole = true;
     for (const MultistatusEntry& entry : *entries) {
-        const auto name = _session.nameFor(entry.href);
+        const auto name = _session.nameFor(pathIn(entry.href));
         if (name && *name == container) {
-            namesItself = entry.isCollection;
+            isNamed = true;
+            isCollection = entry.isCollection;
             continue;
         }
         if (!name || !isMember(*name, container)) {
@@ -116,8 +127,19 @@ StoreListing::Members StoreListing::read(Asked& asked, size_t number) {
         if (entry.status != 0 && entry.status != 200) whole = false;
         inside.emplace_back(*name, entry);
     }
-    if (namesItself && whole) out.entries = std::move(inside);
+    if (!isNamed) isCollection = !inside.empty() || isEmptyCollection(place);
+    if (isCollection && whole) out.entries = std::move(inside);
     return out;
+}
+
+// Of a listing that holds nothing, not even the container itself, as some servers give it: an answer that lost its
+// content looks the same.
+bool StoreListing::isEmptyCollection(const Url& place) {
+    const HttpResponse answer =
+        _session.send(StoreSession::propfind(place, 0), [](int status) { return status == 404; });
+    MultistatusReader reader;
+    const auto entries = answer.status == 207 && reader.feed(answer.body) ? reader.finish() : std::nullopt;
+    return entries && entries->size() == 1 && entries->front().isCollection;
 }
 
 std::vector<StoreListing::Members> StoreListing::readAll(Asked& asked) {
@@ -141,6 +163,8 @@ void StoreListing::stamp(std::string_view name, const MultistatusEntry& entry, c
     info.etag = entry.etag;
     info.modificationdate = info.stored = entry.lastModified;
     info.seen = _versions.knows(name, {entry.etag, entry.lastModified, info.size});
+    // A version without a date is told by its tag alone: known, it is older than every sync, else later.
+    if (!entry.lastModified) info.modificationdate = info.seen ? Date::distantPast() : Date::distantFuture();
     // Only with both dates is it known what "now" is to the server; its files may be dated ahead of its clock.
     if (!info.seen && entry.lastModified && serverDate)
         info.modificationdate = std::max(*entry.lastModified, *serverDate).addingSeconds(kUnseenSeconds);

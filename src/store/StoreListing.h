@@ -47,6 +47,7 @@ private:
     AskedRef ask(const std::vector<Url>& containers, const Url* tagged = nullptr);
     Members read(Asked& asked, size_t number); // of an answer that has come
     std::vector<Members> readAll(Asked& asked);
+    bool isEmptyCollection(const Url& place);
     bool addBuckets(const Members& people, bool tagged, FileListing& out, const CXFileManager::ListingPart& part);
     bool addUnchanged(const Url& container, const std::string& tag, const std::optional<Date>& serverDate,
                       FileListing& out);

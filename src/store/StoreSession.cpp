@@ -8,6 +8,7 @@
 
 #include <algorithm>
 #include <cstdlib>
+#include <strings.h>
 #include <utility>
 
 namespace rolvane {
@@ -15,6 +16,7 @@ namespace rolvane {
 namespace {
 
 constexpr int64_t kBeliefMilliseconds = 30000;
+constexpr HttpLimits kOptionsLimits{20, 10, 1u << 20, 64u << 10};
 
 int64_t steadyMilliseconds() {
     using namespace std::chrono;
@@ -52,6 +54,13 @@ const std::shared_ptr<const std::string>& lockdiscoveryBody() {
     return body;
 }
 
+// A success with another status than the standard's, with the standard's.
+HttpResponse asStandard(std::string_view method, HttpResponse answer) {
+    if (method == "PROPFIND" && answer.status == 200) answer.status = 207;
+    if (method == "DELETE" && answer.status == 207 && namesNoFailure(answer)) answer.status = 204;
+    return answer;
+}
+
 // The answer to a request that has no password to go with.
 HttpResponse unsent() {
     HttpResponse answer;
@@ -70,7 +79,9 @@ bool announcesDavClass(const HttpResponse& answer, std::string_view wanted) {
             const size_t first = value.find_first_not_of(" \t", at);
             if (first < comma) {
                 const std::string_view rest = std::string_view(value).substr(first, comma - first);
-                if (rest.substr(0, rest.find_last_not_of(" \t") + 1) == wanted) return true;
+                const std::string_view token = rest.substr(0, rest.find_last_not_of(" \t") + 1);
+                if (token.size() == wanted.size() && strncasecmp(token.data(), wanted.data(), token.size()) == 0)
+                    return true;
             }
             at = comma + 1;
         }
@@ -78,8 +89,8 @@ bool announcesDavClass(const HttpResponse& answer, std::string_view wanted) {
     return false;
 }
 
-bool announcesDav1(const HttpResponse& answer) {
-    return announcesDavClass(answer, "1");
+bool announcesDav(const HttpResponse& answer) {
+    return announcesDavClass(answer, "1") || announcesDavClass(answer, "2") || announcesDavClass(answer, "3");
 }
 
 std::unique_ptr<CurlTransport> makeAccountTransport(const CXDAVAccount& account) {
@@ -174,7 +185,7 @@ HttpResponse StoreSession::believed(const HttpRequest& asked, HttpResponse answe
     case AnswerVerdict::needsProof: isBelieved = isProven(asked); break;
     case AnswerVerdict::foreign: isBelieved = false; break;
     }
-    if (isBelieved) return answer;
+    if (isBelieved) return asStandard(asked.method, std::move(answer));
     _davSeen = 0; // it may have been one until now
     HttpResponse unbelieved;
     unbelieved.error = TransportError::unreachable;
@@ -257,21 +268,45 @@ std::vector<HttpResponse> StoreSession::optionsAndMore(std::vector<HttpRequest> 
     const auto base = collectionEndpoint(_account.baseLocationFor(_account.user));
     if (!base) return std::vector<HttpResponse>(requests.size() + 1);
     HttpRequest r = request("OPTIONS", *base);
-    r.limits = {20, 10, 1u << 20, 64u << 10};
+    r.limits = kOptionsLimits;
     requests.insert(requests.begin(), std::move(r));
     const std::vector<HttpRequest> asked = requests;
     std::vector<HttpResponse> answers = _transport->performAll(std::move(requests));
     for (size_t i = 0; i < answers.size(); ++i) answers[i] = followed(asked[i], std::move(answers[i]));
-    const HttpResponse& answer = answers.front();
-    if (answer.complete() && (answer.ok() || answer.status == 403 || answer.status == 404) && announcesDav1(answer)) {
-        _davSeen = steadyMilliseconds();
-        _accessLists = announcesDavClass(answer, "access-control") ? 1 : 0;
-        _membersTags = announcesDavClass(answer, kMembersTagClass);
-        _mayKeepLocks = announcesDavClass(answer, "2");
-    } else if (answer.status != 401) {
-        _davSeen = 0;
-    }
+    answers.front() = optionsAbove(std::move(answers.front()));
+    if (!heedOptions(answers.front()) && answers.front().status != 401) _davSeen = 0;
     return answers;
+}
+
+bool StoreSession::heedOptions(const HttpResponse& answer) {
+    const bool isHeeded = answer.ok() || answer.status == 403 || answer.status == 404;
+    if (!answer.complete() || !isHeeded || !announcesDav(answer)) return false;
+    _davSeen = steadyMilliseconds();
+    _accessLists = announcesDavClass(answer, "access-control") ? 1 : 0;
+    _membersTags = announcesDavClass(answer, kMembersTagClass);
+    _mayKeepLocks = announcesDavClass(answer, "2");
+    return true;
+}
+
+// A tree that is not there yet: some servers refuse its OPTIONS, or never answer them. Then the next collection above
+// that is there is asked. The answer to go by.
+HttpResponse StoreSession::optionsAbove(HttpResponse ofTheTree) {
+    const bool isRefused = verdictOn("OPTIONS", ofTheTree) == AnswerVerdict::refusal && !announcesDav(ofTheTree);
+    if (!isRefused && ofTheTree.error != TransportError::timedOut) return ofTheTree;
+    Url above = *endpoint(_account.baseLocationFor(_account.user));
+    while (above.pathComponents().size() > 1) {
+        above = above.cxURLByDeletingLastComponent();
+        HttpRequest looking = propfind(namedAsCollection(above), 0);
+        looking.limits = kOptionsLimits;
+        const int found = performed(std::move(looking)).status;
+        if (found == 404) continue;
+        if (found == 0 || found == 401) break; // nothing better comes of asking on
+        HttpRequest asking = request("OPTIONS", namedAsCollection(above));
+        asking.limits = kOptionsLimits;
+        HttpResponse answer = performed(std::move(asking));
+        return verdictOn("OPTIONS", answer) == AnswerVerdict::success ? answer : ofTheTree;
+    }
+    return ofTheTree;
 }
 
 std::optional<bool> StoreSession::keepsAccessLists() {

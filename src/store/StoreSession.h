@@ -83,6 +83,8 @@ private:
     bool isProven(const HttpRequest& asked);
     bool hasDone(const HttpRequest& asked);
     HttpResponse options();
+    HttpResponse optionsAbove(HttpResponse ofTheTree);
+    bool heedOptions(const HttpResponse& answer);
     std::vector<HttpResponse> optionsAndMore(std::vector<HttpRequest> requests);
     CXDAVError errorFrom(const HttpResponse& answer, const char* asked) const;
 
@@ -106,8 +108,8 @@ private:
 
 // Whether the answer's "DAV" headers name the compliance class (RFC 4918 section 10.1).
 bool announcesDavClass(const HttpResponse& answer, std::string_view name);
-// "DAV: 1, 2" -> true
-bool announcesDav1(const HttpResponse& answer);
+// Upper and lower case are the same to it. "DAV: 1, 2" -> true, and so do 2 and 3 alone, which take in the first.
+bool announcesDav(const HttpResponse& answer);
 
 // The transport for an account over libcurl, without credentials yet.
 std::unique_ptr<CurlTransport> makeAccountTransport(const CXDAVAccount& account);

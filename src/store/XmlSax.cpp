@@ -29,7 +29,13 @@ XmlSax::XmlSax(int maxDepth) : _maxDepth(static_cast<size_t>(maxDepth)) {
     _handler.endElementNs = &XmlSax::onEnd;
     _handler.characters = &XmlSax::onText;
     _handler.cdataBlock = &XmlSax::onText;
-    _handler.internalSubset = &XmlSax::onDoctype;
+    // A document type that only has a name says nothing; what one declares could change all that follows.
+    _handler.entityDecl = &XmlSax::onEntity;
+    _handler.attributeDecl = &XmlSax::onAttribute;
+    _handler.elementDecl = &XmlSax::onElement;
+    _handler.notationDecl = &XmlSax::onNotation;
+    _handler.unparsedEntityDecl = &XmlSax::onUnparsed;
+    _handler.reference = &XmlSax::onReference;
     _handler.warning = &silent;
     _handler.error = &silent;
     _handler.serror = &silentStructured;
@@ -85,7 +91,28 @@ void XmlSax::onText(void* self, const xmlChar* characters, int length) {
     if (!sax->text({reinterpret_cast<const char*>(characters), static_cast<size_t>(length)})) sax->refuse();
 }
 
-void XmlSax::onDoctype(void* self, const xmlChar*, const xmlChar*, const xmlChar*) {
+void XmlSax::onReference(void* self, const xmlChar*) {
+    static_cast<XmlSax*>(self)->refuse();
+}
+
+void XmlSax::onEntity(void* self, const xmlChar*, int, const xmlChar*, const xmlChar*, xmlChar*) {
+    static_cast<XmlSax*>(self)->refuse();
+}
+
+void XmlSax::onAttribute(void* self, const xmlChar*, const xmlChar*, int, int, const xmlChar*, xmlEnumerationPtr tree) {
+    xmlFreeEnumeration(tree); // it is handed over
+    static_cast<XmlSax*>(self)->refuse();
+}
+
+void XmlSax::onElement(void* self, const xmlChar*, int, xmlElementContentPtr) {
+    static_cast<XmlSax*>(self)->refuse();
+}
+
+void XmlSax::onNotation(void* self, const xmlChar*, const xmlChar*, const xmlChar*) {
+    static_cast<XmlSax*>(self)->refuse();
+}
+
+void XmlSax::onUnparsed(void* self, const xmlChar*, const xmlChar*, const xmlChar*, const xmlChar*) {
     static_cast<XmlSax*>(self)->refuse();
 }
 

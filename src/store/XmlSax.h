@@ -7,8 +7,9 @@
 
 namespace rolvane {
 
-// A namespace-aware push parser over libxml2's SAX2 interface. A document type declaration, depth over the limit or a
-// false from a handler ends it. Base of the readers of WebDAV bodies; one thread.
+// A namespace-aware push parser over libxml2's SAX2 interface. A declaration within a document type, a
+// reference to an entity that XML does not define, depth over the limit or a false from a handler ends it. Base of the
+// readers of WebDAV bodies; one thread.
 class XmlSax {
 public:
     explicit XmlSax(int maxDepth);
@@ -30,7 +31,12 @@ private:
                         const xmlChar**, int, int, const xmlChar**);
     static void onEnd(void* self, const xmlChar* local, const xmlChar* prefix, const xmlChar* uri);
     static void onText(void* self, const xmlChar* characters, int length);
-    static void onDoctype(void* self, const xmlChar*, const xmlChar*, const xmlChar*);
+    static void onReference(void* self, const xmlChar*);
+    static void onEntity(void* self, const xmlChar*, int, const xmlChar*, const xmlChar*, xmlChar*);
+    static void onAttribute(void* self, const xmlChar*, const xmlChar*, int, int, const xmlChar*, xmlEnumerationPtr);
+    static void onElement(void* self, const xmlChar*, int, xmlElementContentPtr);
+    static void onNotation(void* self, const xmlChar*, const xmlChar*, const xmlChar*);
+    static void onUnparsed(void* self, const xmlChar*, const xmlChar*, const xmlChar*, const xmlChar*);
     void refuse();
 
     xmlSAXHandler _handler{};

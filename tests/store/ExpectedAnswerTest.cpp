@@ -52,7 +52,20 @@ TEST(ExpectedAnswer, EachMethodHasItsOwnSuccess) {
     EXPECT_EQ(verdictsOn(207), ".S..fffff.f.");
     EXPECT_EQ(verdictsOn(200, {{"dav", "1, 2"}}), "S.SSPPP..PS.");
     EXPECT_EQ(verdictsOn(204, {{"dav", "1"}}), "S...SSPSSSS.");
-    EXPECT_EQ(verdictsOn(200, {{"dav", "3"}}), "..SSPPP..PS.");
+    for (const char* classes : {"2", "3", "extended-mkcol, 2", " 1"})
+        EXPECT_EQ(verdictsOn(200, {{"dav", classes}}), "S.SSPPP..PS.") << classes;
+    EXPECT_EQ(verdictsOn(200, {{"dav", "x"}, {"dav", "ACCESS-control,1"}}), "S.SSPPP..PS.");
+    for (const char* classes : {"", "4", "12", "access-control"})
+        EXPECT_EQ(verdictsOn(200, {{"dav", classes}}), "..SSPPP..PS.") << classes;
+    EXPECT_EQ(verdictsOn(200, kXml, "<multistatus xmlns=\"DAV:\"/>"), ".SSSPPP..PS.") << "which should be 207";
+    const auto deleted = [](const std::string& status) {
+        return verdictsOn(207, kXml,
+                          "<D:multistatus xmlns:D=\"DAV:\"><D:response><D:href>/x</D:href><D:status>HTTP/1.1 " +
+                              status + "</D:status></D:response></D:multistatus>");
+    };
+    EXPECT_EQ(deleted("200 OK"), ".S..fSfff.f.");
+    EXPECT_EQ(deleted("404 Not Found"), ".S..fSfff.f.");
+    EXPECT_EQ(deleted("423 Locked"), ".S..fffff.f.");
 }
 
 TEST(ExpectedAnswer, AWebPageIsNoSuccessByItself) {
