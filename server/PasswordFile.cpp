@@ -5,7 +5,10 @@
 
 #include <algorithm>
 #include <array>
+#include <crypt.h>
 #include <map>
+#include <memory>
+#include <openssl/crypto.h>
 #include <openssl/evp.h>
 #include <openssl/rand.h>
 #include <unistd.h>
@@ -14,85 +17,36 @@ namespace rolvane {
 
 namespace {
 
-using Digest = std::array<unsigned char, 16>;
-constexpr std::string_view kSaltAlphabet = "./0123456789ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz";
-
-class MD5 {
-public:
-    MD5() { EVP_DigestInit_ex(_context, EVP_md5(), nullptr); }
-    ~MD5() { EVP_MD_CTX_free(_context); }
-    MD5(const MD5&) = delete;
-    MD5& operator=(const MD5&) = delete;
-    void add(const void* data, size_t size) { EVP_DigestUpdate(_context, data, size); }
-    void add(std::string_view text) { add(text.data(), text.size()); }
-    void add(const Digest& digest) { add(digest.data(), digest.size()); }
-    Digest finish() {
-        Digest out;
-        EVP_DigestFinal_ex(_context, out.data(), nullptr);
-        return out;
-    }
-
-private:
-    EVP_MD_CTX* _context = EVP_MD_CTX_new();
-};
-
-Digest firstDigest(std::string_view password, std::string_view salt) {
-    MD5 inner;
-    inner.add(password);
-    inner.add(salt);
-    inner.add(password);
-    const Digest mixed = inner.finish();
-
-    MD5 outer;
-    outer.add(password);
-    outer.add("$apr1$");
-    outer.add(salt);
-    for (size_t left = password.size(); left > 0; left -= std::min<size_t>(left, mixed.size()))
-        outer.add(mixed.data(), std::min<size_t>(left, mixed.size()));
-    for (size_t bits = password.size(); bits > 0; bits >>= 1)
-        outer.add(bits & 1 ? std::string_view("\0", 1) : password.substr(0, 1));
-    return outer.finish();
-}
-
-Digest stretched(Digest digest, std::string_view password, std::string_view salt) {
-    for (int round = 0; round < 1000; ++round) {
-        MD5 next;
-        round % 2 ? next.add(password) : next.add(digest);
-        if (round % 3) next.add(salt);
-        if (round % 7) next.add(password);
-        round % 2 ? next.add(digest) : next.add(password);
-        digest = next.finish();
-    }
-    return digest;
-}
-
-// Six bits a character, lowest first.
-void appendBase64(std::string& out, unsigned value, int characters) {
-    for (; characters > 0; --characters, value >>= 6) out += kSaltAlphabet[value & 0x3f];
-}
-
-std::string randomSalt() {
-    std::array<unsigned char, 8> bytes;
-    if (RAND_bytes(bytes.data(), bytes.size()) != 1)
-        throw CXException("CXPrivateStoreException",
-                          "No random numbers are to be had from OpenSSL for a password's salt.");
-    std::string salt;
-    for (unsigned char byte : bytes) salt += kSaltAlphabet[byte % kSaltAlphabet.size()];
-    return salt;
+// The bcrypt form of the password ("$2y$cost$salt and digest").
+std::string bcryptPassword(const std::string& password, int cost) {
+    std::array<char, 16> random{};
+    std::array<char, CRYPT_GENSALT_OUTPUT_SIZE> setting{};
+    const auto work = std::make_unique<crypt_data>();
+    if (RAND_bytes(reinterpret_cast<unsigned char*>(random.data()), random.size()) != 1 ||
+        !crypt_gensalt_rn("$2y$", static_cast<unsigned long>(cost), random.data(), random.size(), setting.data(),
+                          setting.size()))
+        throw CXException("CXPrivateStoreException", "No random numbers are to be had for a password's salt.");
+    const char* hash = crypt_r(password.c_str(), setting.data(), work.get());
+    OPENSSL_cleanse(work->internal, sizeof work->internal);
+    if (!hash || !std::string_view(hash).starts_with("$2y$"))
+        throw CXException("CXPrivateStoreException", "The password cannot be hashed with bcrypt on this system.");
+    return hash;
 }
 
 std::string digestEntry(const std::string& user, const std::string& realm, const std::string& password) {
-    MD5 md5;
-    md5.add(user + ":" + realm + ":" + password);
+    const std::string text = user + ":" + realm + ":" + password;
+    std::array<unsigned char, EVP_MAX_MD_SIZE> digest{};
+    unsigned int length = 0;
+    if (EVP_Digest(text.data(), text.size(), digest.data(), &length, EVP_md5(), nullptr) != 1)
+        throw CXException("CXPrivateStoreException", "OpenSSL gives no MD5, which Digest authentication needs.");
     std::string hex;
-    for (unsigned char byte : md5.finish()) {
-        hex += "0123456789abcdef"[byte >> 4];
-        hex += "0123456789abcdef"[byte & 15];
+    for (unsigned int i = 0; i < length; ++i) {
+        hex += "0123456789abcdef"[digest[i] >> 4];
+        hex += "0123456789abcdef"[digest[i] & 15];
     }
     return realm + ":" + hex;
 }
 
-// user -> what follows the first colon
 std::map<std::string, std::string, std::less<>> readEntries(const std::string& path) {
     std::map<std::string, std::string, std::less<>> entries;
     if (access(path.c_str(), F_OK) != 0) return entries;
@@ -117,17 +71,8 @@ void writeEntries(const std::string& path, const std::map<std::string, std::stri
 
 } // namespace
 
-std::string aprMD5Password(std::string_view password, std::string_view salt) {
-    const Digest d = stretched(firstDigest(password, salt), password, salt);
-    std::string out = "$apr1$" + std::string(salt) + "$";
-    constexpr int kOrder[5][3] = {{0, 6, 12}, {1, 7, 13}, {2, 8, 14}, {3, 9, 15}, {4, 10, 5}};
-    for (const auto& [high, middle, low] : kOrder) appendBase64(out, d[high] << 16 | d[middle] << 8 | d[low], 4);
-    appendBase64(out, d[11], 2);
-    return out;
-}
-
-PasswordFile::PasswordFile(std::string passwordsPath, std::string digestsPath, std::string realm, mode_t mode)
-    : _passwords(std::move(passwordsPath)), _digests(std::move(digestsPath)), _realm(std::move(realm)), _mode(mode) {}
+PasswordFile::PasswordFile(std::string passwordsPath, std::string digestsPath, std::string realm, Kept kept)
+    : _passwords(std::move(passwordsPath)), _digests(std::move(digestsPath)), _realm(std::move(realm)), _kept(kept) {}
 
 bool PasswordFile::isValidUser(std::string_view user) {
     const auto isAlphanumeric = [](char c) {
@@ -149,23 +94,38 @@ bool PasswordFile::contains(std::string_view user) const {
     return readEntries(_passwords).contains(user);
 }
 
+std::vector<std::string> PasswordFile::usersWithoutDigest() const {
+    const auto digests = readEntries(_digests);
+    std::vector<std::string> names = users();
+    std::erase_if(names, [&](const std::string& user) { return digests.contains(user); });
+    return names;
+}
+
 void PasswordFile::set(const std::string& user, const std::string& password) {
     auto passwords = readEntries(_passwords);
-    auto digests = readEntries(_digests);
-    passwords[user] = aprMD5Password(password, randomSalt());
-    digests[user] = digestEntry(user, _realm, password);
-    writeEntries(_digests, digests, _mode);
-    writeEntries(_passwords, passwords, _mode);
+    passwords[user] = bcryptPassword(password, _kept.cost);
+    if (_kept.digests) {
+        auto digests = readEntries(_digests);
+        digests[user] = digestEntry(user, _realm, password);
+        writeEntries(_digests, digests, _kept.mode);
+    }
+    writeEntries(_passwords, passwords, _kept.mode);
 }
 
 bool PasswordFile::remove(const std::string& user) {
     auto passwords = readEntries(_passwords);
-    auto digests = readEntries(_digests);
     const bool known = passwords.erase(user) > 0;
-    digests.erase(user);
-    writeEntries(_digests, digests, _mode);
-    writeEntries(_passwords, passwords, _mode);
+    if (access(_digests.c_str(), F_OK) == 0) {
+        auto digests = readEntries(_digests);
+        digests.erase(user);
+        writeEntries(_digests, digests, _kept.mode);
+    }
+    writeEntries(_passwords, passwords, _kept.mode);
     return known;
+}
+
+void PasswordFile::dropDigests() const {
+    unlink(_digests.c_str());
 }
 
 } // namespace rolvane

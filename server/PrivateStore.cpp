@@ -117,7 +117,9 @@ struct PrivateStore::Implementation {
     }
     PasswordFile passwords() const {
         return PasswordFile(state + "/conf/passwords", state + "/conf/digests", kStoreRealm,
-                            StorePlaces::fileMode(StoreIdentity::choose()));
+                            {.digests = options.authentication == StoreAuthentication::digest,
+                             .cost = options.passwordCost,
+                             .mode = StorePlaces::fileMode(StoreIdentity::choose())});
     }
 
     void makeDirectories() const;
@@ -126,6 +128,8 @@ struct PrivateStore::Implementation {
     StoreIdentity identityFor() const;
     void checkProgram() const;
     void endOrphans() const;
+    void saveSettings(int port) const;
+    void checkDigests() const;
     void writeConfiguration(int port);
     void makeTrees(const StoreIdentity& identity) const;
     void startLocked();
@@ -185,7 +189,23 @@ void PrivateStore::Implementation::writeConfiguration(int port) {
         state + "/conf/users.conf",
         renderStoreUsers(davDirectory(), passwords().users(), options.authentication, options.keepsAccessLists()),
         mode);
+    saveSettings(port);
+}
+
+void PrivateStore::Implementation::saveSettings(int port) const {
     writeFileDurably(settingsFile(), PropertyList::toXML(storeOptionsToDictionary(options, port)));
+}
+
+// The entries for Digest can be made when a password is given, and not from what is kept of it. They are as good as the
+// passwords: a store that does not ask for them keeps none.
+void PrivateStore::Implementation::checkDigests() const {
+    if (options.authentication != StoreAuthentication::digest) return passwords().dropDigests();
+    std::string names;
+    for (const std::string& user : passwords().usersWithoutDigest()) names += (names.empty() ? "" : ", ") + user;
+    if (names.empty()) return;
+    saveSettings(savedPort());
+    fail("The store is to use Digest from now on, and has no password in that form for: " + names +
+         ". Give each of them a password again (rolvane store user add NAME), then start the store.");
 }
 
 void PrivateStore::Implementation::makeTrees(const StoreIdentity& identity) const {
@@ -196,6 +216,7 @@ void PrivateStore::Implementation::makeTrees(const StoreIdentity& identity) cons
 void PrivateStore::Implementation::startLocked() {
     if (running()) return;
     checkProgram();
+    checkDigests();
     endOrphans();
     const StoreIdentity identity = identityFor();
     int port = options.port ? options.port : savedPort();
@@ -340,6 +361,9 @@ void PrivateStore::addUser(const std::string& user, const std::string& password)
              "a letter, a digit or _.");
     if (password.empty() || password.find_first_of(std::string("\n\r\0", 3)) != std::string::npos)
         fail("The password of " + user + " must not be empty or hold a line break. Choose another one.");
+    if (password.size() > PasswordFile::kLongestPassword)
+        fail("The password of " + user + " is longer than " + std::to_string(PasswordFile::kLongestPassword) +
+             " bytes, and what comes after them would not count. Choose a shorter one.");
     _implementation->makeDirectories();
     const LauncherLock lock(_implementation->state);
     const bool known = _implementation->passwords().contains(user);

@@ -29,6 +29,7 @@ struct PrivateStoreOptions {
     int threadsPerProcess = 32;
     int keepAliveSeconds = 60;
     int maximumKeepAliveRequests = 0;            // 0 = no limit
+    int passwordCost = 10;                       // of bcrypt (PasswordFile.h); not kept from one start to the next
     std::string logLevel = "warn";               // httpd's LogLevel
     bool accessLog = false;                      // a line a request in logs/access.log
     std::vector<std::string> extraConfiguration; // lines at the end of the configuration
@@ -41,6 +42,7 @@ struct PrivateStoreOptions {
     std::string accessModule;          // a file, mod_davacl; "" likewise, else the one among httpdModules
 
     bool keepsAccessLists() const { return accessLists && authentication != StoreAuthentication::none; }
+    bool needsModule() const { return keepsAccessLists() || authentication == StoreAuthentication::basic; }
 };
 
 struct PrivateStoreStatus {

@@ -38,6 +38,7 @@ std::string switches(const PrivateStoreOptions& options) {
     if (options.accessLog) text += "Define ACCESSLOG\n";
     if (options.authentication == StoreAuthentication::basic) text += "Define BASIC\n";
     if (options.authentication == StoreAuthentication::digest) text += "Define DIGEST\n";
+    if (options.needsModule()) text += "Define DAVACL\n";
     if (options.keepsAccessLists()) text += "Define ACCESSLISTS\n";
     return text;
 }
@@ -105,12 +106,12 @@ std::string renderStoreConfiguration(const std::string& templateText, const Priv
     for (const auto& path : {options.stateDirectory, options.documentRoot, options.httpdModules})
         refuseUnsafePath(path);
     refuseUnsafeWord("log level", options.logLevel);
-    const std::string module = !options.keepsAccessLists()    ? "/none"
+    const std::string module = !options.needsModule()         ? "/none"
                                : options.accessModule.empty() ? storeAccessModulePath(options.httpdModules)
                                                               : options.accessModule;
     if (module.empty())
         throw CXException(kCXPrivateStoreException,
-                          "The store's access lists need mod_davacl.so, which is missing from " +
+                          "The store's access lists and passwords need mod_davacl.so, which is missing from " +
                               std::string(ROLVANE_INSTALLED_MODULES) + ". Install rolvane again.");
     refuseUnsafePath(module);
     const std::string number = std::to_string(port);

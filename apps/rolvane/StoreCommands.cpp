@@ -95,7 +95,8 @@ void addStoreCommands(CLI::App& app, Context& context) {
             directory(c);
             c.add_option("--root", o->root, "Where the published files lie");
             c.add_option("--port", o->port, "Port; the one of the last start, else a free one");
-            c.add_option("--authentication", o->authentication, "basic, digest or none")
+            c.add_option("--authentication", o->authentication,
+                         "basic, digest (keeps what is as good as the passwords) or none")
                 ->check(CLI::IsMember({"basic", "digest", "none"}));
             c.add_flag("--no-tls", o->noTLS, "Plain http");
             c.add_flag("--access-log,!--no-access-log", o->accessLog,

@@ -32,6 +32,7 @@ struct RequestState {
     std::map<std::string, bool, std::less<>> knownUsers; // as the providers said
     std::optional<Missing> destinationLacks;             // why the sub-request for a Destination was refused
     std::vector<ListStore::Guard> guards;
+    std::map<const ap_conf_vector_t*, ap_conf_vector_t*> confined; // the sections' settings, and with ours on top
 
     void forgetLists() { // they are read anew
         lists.clear();

@@ -1,5 +1,8 @@
 #include "server/mod_davacl/Configuration.h"
 
+#include "server/mod_davacl/Confinement.h"
+#include "server/mod_davacl/Passwords.h"
+#include "server/mod_davacl/TreeDirectories.h"
 #include "server/mod_davacl/TreePath.h"
 
 #include <cstring>
@@ -96,6 +99,11 @@ const char* setMaxEntries(cmd_parms* cmd, void*, const char* text) {
                                                                     : "the number of entries must be from 1 to 100000";
 }
 
+const char* setStrict(cmd_parms* cmd, void*, int on) {
+    ofServer(cmd->server)->strict = on;
+    return nullptr;
+}
+
 // AP_INIT_* want the one type of function in a union that C++ will not convert to.
 template <class Function>
 cmd_func asCommand(Function function) {
@@ -110,9 +118,9 @@ bool isWithin(const char* path, const char* directory) {
 const char* complaintAbout(const server_rec* server) {
     const Configuration* c = ofServer(server);
     if (!c->base) {
-        if (c->principals || c->groupFile || c->users || c->userFile || c->depth || c->entries)
-            return "DavAclPrincipals, DavAclGroupFile, DavAclUsers, DavAclUserFile, DavAclDepth and DavAclMaxEntries "
-                   "need a DavAclBase";
+        if (c->principals || c->groupFile || c->users || c->depth || c->entries)
+            return "DavAclPrincipals, DavAclGroupFile, DavAclUsers, DavAclDepth and DavAclMaxEntries need a "
+                   "DavAclBase";
         return nullptr;
     }
     if (isWithin(c->base, c->principalBase()) || isWithin(c->principalBase(), c->base))
@@ -131,6 +139,11 @@ const Configuration* configurationOf(const request_rec* r) {
     return c && c->base ? c : nullptr;
 }
 
+const char* userFileOf(const request_rec* r) {
+    const Configuration* c = ofServer(r->server);
+    return c ? c->userFile : nullptr;
+}
+
 void* createConfiguration(apr_pool_t* pool, server_rec*) {
     return new (apr_palloc(pool, sizeof(Configuration))) Configuration;
 }
@@ -147,6 +160,7 @@ void* mergeConfigurations(apr_pool_t* pool, void* base, void* more) {
     if (inner->groupFile) merged->groupFile = inner->groupFile;
     if (inner->users) merged->users = inner->users;
     if (inner->userFile) merged->userFile = inner->userFile;
+    if (inner->strict >= 0) merged->strict = inner->strict;
     if (inner->depth) merged->depth = inner->depth;
     if (inner->entries) merged->entries = inner->entries;
     return merged;
@@ -187,18 +201,33 @@ void warnAboutDavAbove(const ap_directive_t* directive, const server_rec* server
     }
 }
 
-} // namespace
-
-int checkConfigurations(apr_pool_t*, apr_pool_t*, apr_pool_t*, server_rec* server) {
-    for (const server_rec* each = server; each; each = each->next)
-        if (ap_state_query(AP_SQ_MAIN_STATE) != AP_SQ_MS_CREATE_PRE_CONFIG && ofServer(each)->base)
-            warnAboutDavAbove(ap_conftree, each, *ofServer(each));
+int checkDirectives(const server_rec* server) {
     for (; server; server = server->next)
         if (const char* complaint = complaintAbout(server)) {
             ap_log_error(APLOG_MARK, APLOG_STARTUP | APLOG_ERR, 0, server, "davacl: %s", complaint);
             return HTTP_INTERNAL_SERVER_ERROR;
         }
     return OK;
+}
+
+} // namespace
+
+int checkConfigurations(apr_pool_t* pool, apr_pool_t*, apr_pool_t* temporary, server_rec* main) {
+    if (ap_state_query(AP_SQ_MAIN_STATE) == AP_SQ_MS_CREATE_PRE_CONFIG) return checkDirectives(main);
+    if (const int answer = checkDirectives(main); answer != OK) return answer;
+    const char* complaint = prepareConfinement(pool, temporary, main);
+    if (!complaint) complaint = preparePasswords(pool);
+    bool strict = complaint;
+    if (!complaint) complaint = findDirectories(pool, main);
+    for (const server_rec* each = main; each; each = each->next) {
+        if (!ofServer(each)->base) continue;
+        warnAboutDavAbove(ap_conftree, each, *ofServer(each));
+        strict = strict || ofServer(each)->isStrict();
+    }
+    if (!complaint) return OK;
+    ap_log_error(APLOG_MARK, APLOG_STARTUP | (strict ? APLOG_ERR : APLOG_WARNING), 0, main, "davacl: %s%s", complaint,
+                 strict ? " (with DavAclStrict Off httpd would start all the same)" : "");
+    return strict ? HTTP_INTERNAL_SERVER_ERROR : OK;
 }
 
 const command_rec kDirectives[] = {
@@ -211,6 +240,8 @@ const command_rec kDirectives[] = {
      "authentication providers that know which users exist"},
     {"DavAclUserFile", asCommand(setUserFile), nullptr, RSRC_CONF, TAKE1,
      "a file with a line for each user, which begins with the name and a colon, such as AuthUserFile names"},
+    {"DavAclStrict", asCommand(setStrict), nullptr, RSRC_CONF, FLAG,
+     "whether a way around the lists that cannot be closed keeps httpd from starting: On by default"},
     {"DavAclMaxEntries", asCommand(setMaxEntries), nullptr, RSRC_CONF, TAKE1,
      "how many entries a list may hold: 1000 by default"},
     {"DavAclDepth", asCommand(setDepth), nullptr, RSRC_CONF, TAKE1,

@@ -13,8 +13,10 @@ struct Configuration {
     apr_array_header_t* users = nullptr; // of const char*: the authentication providers that know who exists
     const char* userFile = nullptr;      // null: none; who stands in it exists, and no provider is asked
     int entries = 0;                     // the most that a list holds
+    int strict = -1;                     // whether a way around the lists keeps httpd from starting; -1: not said
     int depth = 0;                       // how many segments below the base may have lists of their own
 
+    bool isStrict() const { return strict != 0; }
     const char* principalBase() const { return principals ? principals : "/principals"; }
     size_t mostEntries() const { return entries ? static_cast<size_t>(entries) : 1000; }
     size_t levels() const { return depth ? static_cast<size_t>(depth) : 2; }
@@ -22,6 +24,9 @@ struct Configuration {
 
 // Null where no tree is under access lists.
 const Configuration* configurationOf(const request_rec* r);
+
+// DavAclUserFile's argument, with or without a base; null when there is none.
+const char* userFileOf(const request_rec* r);
 
 void* createConfiguration(apr_pool_t* pool, server_rec* server);
 void* mergeConfigurations(apr_pool_t* pool, void* base, void* more);

@@ -70,6 +70,18 @@ int refuseReach(request_rec* r) {
     return dav_handle_err(r, error, nullptr);
 }
 
+// Files that httpd would read as configuration where AllowOverride lets it.
+bool namesConfiguration(const request_rec* r, const TreePath& place) {
+    const auto* core = static_cast<const core_server_config*>(ap_get_core_module_config(r->server->module_config));
+    const char* names = core->access_name ? core->access_name : "";
+    while (*names) {
+        const std::string name = ap_getword_conf(r->pool, &names);
+        if (name == place.owner || std::find(place.below.begin(), place.below.end(), name) != place.below.end())
+            return true;
+    }
+    return false;
+}
+
 int check(request_rec* r) {
     const Configuration* c = configurationOf(r);
     if (!c) return DECLINED;
@@ -80,7 +92,7 @@ int check(request_rec* r) {
     // Every sub-request that asks where something lies ends here, too: it is no request of its own.
     if (takesInAll && (!r->main || destination) && reachesIntoForeignTrees(r, *c, destination)) return refuseReach(r);
     if (!place) return DECLINED;
-    if (place->isReserved()) return HTTP_FORBIDDEN;
+    if (place->isReserved() || namesConfiguration(r, *place)) return HTTP_FORBIDDEN;
     const Standing standing = standingOf(r);
     const auto missing =
         missingOf(r, *c, *place, destination ? needsOfDestination(r->method, standing) : needsOf(r->method, standing));

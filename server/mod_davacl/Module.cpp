@@ -3,8 +3,10 @@
 #include "server/mod_davacl/AclMethod.h"
 #include "server/mod_davacl/Changes.h"
 #include "server/mod_davacl/Configuration.h"
+#include "server/mod_davacl/Confinement.h"
 #include "server/mod_davacl/Enforcement.h"
 #include "server/mod_davacl/LiveProperties.h"
+#include "server/mod_davacl/Passwords.h"
 #include "server/mod_davacl/PrincipalResources.h"
 
 namespace rolvane::davacl {
@@ -22,6 +24,8 @@ void registerHooks(apr_pool_t* pool) noexcept {
     static const char* const beforeDav[] = {"mod_dav.c", nullptr};
     ap_hook_pre_config(beforeConfiguration, nullptr, nullptr, APR_HOOK_MIDDLE);
     ap_hook_post_config(checkConfigurations, nullptr, nullptr, APR_HOOK_MIDDLE);
+    ap_hook_post_perdir_config(confine, nullptr, nullptr, APR_HOOK_MIDDLE);
+    ap_hook_handler(serveConfined, nullptr, nullptr, APR_HOOK_REALLY_FIRST - 10);
     ap_hook_fixups(enforce, nullptr, nullptr, APR_HOOK_REALLY_FIRST);
     ap_hook_handler(servePrincipals, nullptr, beforeDav, APR_HOOK_FIRST);
     ap_hook_handler(serveAcl, nullptr, beforeDav, APR_HOOK_FIRST);
@@ -33,6 +37,7 @@ void registerHooks(apr_pool_t* pool) noexcept {
     dav_register_liveprop_group(pool, &kLiveProperties);
     dav_options_provider_register(pool, "davacl", const_cast<dav_options_provider*>(&kOptions));
     registerChangeFilters();
+    registerPasswords(pool);
 }
 
 } // namespace

@@ -15,15 +15,29 @@ constexpr std::pair<const char*, const char*> kDirectories[] = {{"XDG_DATA_HOME"
 } // namespace
 
 Neighbour::Neighbour(CommandWorld& world, const std::string& name, bool withBus) : user(name), _world(world) {
+    makeHome(withBus);
+    world.store().addUser(user, UserWorld::kPassword);
+    setAccount({"--endpoint", world.store().endpointTemplate(), "--ca-file", world.store().caFile()});
+}
+
+Neighbour::Neighbour(CommandWorld& world, const std::string& name, const std::vector<std::string>& account)
+    : user(name), _world(world) {
+    makeHome(true);
+    setAccount(account);
+}
+
+void Neighbour::makeHome(bool withBus) {
     for (const auto& [variable, directory] : kDirectories) {
         std::filesystem::create_directory(_home / directory);
         std::filesystem::permissions(_home / directory, std::filesystem::perms::owner_all);
     }
     if (withBus) _bus = std::make_unique<PrivateBus>();
-    world.store().addUser(user, UserWorld::kPassword);
-    const Ran made = rolvane({"account", "set", "--user", user, "--endpoint", world.store().endpointTemplate(),
-                              "--ca-file", world.store().caFile(), "--ask-password"},
-                             std::string(UserWorld::kPassword) + "\n");
+}
+
+void Neighbour::setAccount(const std::vector<std::string>& account) {
+    std::vector<std::string> arguments = {"account", "set", "--user", user, "--ask-password"};
+    arguments.insert(arguments.end(), account.begin(), account.end());
+    const Ran made = rolvane(std::move(arguments), std::string(UserWorld::kPassword) + "\n");
     EXPECT_EQ(made.status, kDone) << made;
 }
 

@@ -10,6 +10,8 @@ class Neighbour {
 public:
     // Signs up at the world's store.
     Neighbour(CommandWorld& world, const std::string& user, bool withBus = true);
+    // On another store, where the user is known by UserWorld::kPassword: options of `rolvane account set`.
+    Neighbour(CommandWorld& world, const std::string& user, const std::vector<std::string>& account);
     ~Neighbour();
     Neighbour(const Neighbour&) = delete;
     Neighbour& operator=(const Neighbour&) = delete;
@@ -25,6 +27,8 @@ public:
     const std::string user;
 
 private:
+    void makeHome(bool withBus);
+    void setAccount(const std::vector<std::string>& account);
     std::vector<std::string> environment() const;
 
     CommandWorld& _world;

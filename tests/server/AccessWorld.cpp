@@ -23,10 +23,9 @@ void replaceAll(std::string& text, const std::string& from, const std::string& t
 std::string withDbm(std::string text) {
     replaceAll(text, "mod_authn_file.so", "mod_authn_dbm.so");
     replaceAll(text, "authn_file_module", "authn_dbm_module");
-    replaceAll(text, "AuthBasicProvider file", "AuthBasicProvider dbm");
+    replaceAll(text, "AuthBasicProvider davacl",
+               "AuthBasicProvider dbm\nAuthDBMType SDBM\nAuthDBMUserFile \"@STATE@/conf/users\"");
     replaceAll(text, "DavAclUserFile \"@STATE@/conf/passwords\"", "DavAclUsers dbm");
-    replaceAll(text, "AuthUserFile \"@STATE@/conf/passwords\"",
-               "AuthDBMType SDBM\nAuthDBMUserFile \"@STATE@/conf/users\"");
     return text;
 }
 

@@ -560,7 +560,7 @@ TEST(PrivateStore, KeepsKeysAndPasswordsFromOtherUsersWhateverTheUmask) {
     umask(before);
     const std::string state = world.store.stateDirectory();
     EXPECT_EQ(modeOf(state) & 066u, 0u) << "others list or write it";
-    for (const char* file : {"/tls/server.key", "/conf/passwords", "/conf/digests", "/conf/httpd.conf", "/store.plist"})
+    for (const char* file : {"/tls/server.key", "/conf/passwords", "/conf/httpd.conf", "/store.plist"})
         EXPECT_EQ(modeOf(state + file) & 07u, 0u) << file;
     EXPECT_THAT(readFile(state + "/conf/passwords"), Not(HasSubstr("wonder land")));
 }

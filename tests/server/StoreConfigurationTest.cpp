@@ -37,9 +37,10 @@ TEST(StoreConfiguration, ListensOnTheLoopbackAddressesAlone) {
 TEST(StoreConfiguration, PutsValuesInOnceAndDoesNotReadThemAgain) {
     PrivateStoreOptions o = options();
     o.extraConfiguration = {"# @STATE@ me@example.org"};
-    EXPECT_EQ(renderStoreConfiguration("a@b @LISTEN@\n@EXTRA@", o, 1, false),
-              "Define TLS\nDefine HTTP2\nDefine BASIC\nDefine ACCESSLISTS\na@b Listen 127.0.0.1:1\n# @STATE@ "
-              "me@example.org\n");
+    EXPECT_EQ(
+        renderStoreConfiguration("a@b @LISTEN@\n@EXTRA@", o, 1, false),
+        "Define TLS\nDefine HTTP2\nDefine BASIC\nDefine DAVACL\nDefine ACCESSLISTS\na@b Listen 127.0.0.1:1\n# @STATE@ "
+        "me@example.org\n");
 }
 
 TEST(StoreConfiguration, RefusesWhatWouldEscapeFromItsQuotationMarks) {

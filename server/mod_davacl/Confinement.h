@@ -1,0 +1,17 @@
+#pragma once
+
+#include "server/mod_davacl/Httpd.h"
+
+namespace rolvane::davacl {
+
+// What lies below the base and the principals is answered by mod_dav, this module and httpd's own sending of files, and
+// by nobody else, whatever the rest of the configuration says.
+
+// Reads the settings that hold there, once for a configuration. Nothing, or a complaint.
+const char* prepareConfinement(apr_pool_t* pool, apr_pool_t* temporary, server_rec* server);
+// When all sections that concern the request are joined: the settings come on top.
+int confine(request_rec* r) noexcept;
+// In the place of all other handlers; never declines there.
+int serveConfined(request_rec* r) noexcept;
+
+} // namespace rolvane::davacl
