@@ -91,13 +91,22 @@ std::optional<LockGrant> unheardLock(const StandingLocks& standing, const LockTo
     return std::nullopt;
 }
 
+// The store shows which locks stand there, and this one is not among them.
+bool isNotThere(StoreSession& session, const Url& endpoint, const LockToken& token) {
+    const StandingLocks standing = locksThere(session, endpoint);
+    return standing.answered && std::none_of(standing.locks.begin(), standing.locks.end(),
+                                             [&](const LockGrant& lock) { return lock.token == token; });
+}
+
 // Whether the store knows the lock no more. Asked twice where no answer comes: a lock that stays is in everybody's way.
+// A store may refuse to release what is gone with any error (httpd: 400), so a refusal is followed by a look.
 bool release(StoreSession& session, const Url& endpoint, const LockToken& token) {
     HttpRequest r = StoreSession::request("UNLOCK", endpoint);
     r.headers = {{"Lock-Token", "<" + token.str() + ">"}};
     HttpResponse answer = session.sendUnnoted(r);
     if (!answer.complete()) answer = session.sendUnnoted(std::move(r));
     if (answer.ok() || isGone(answer)) return true;
+    if (answer.complete() && isNotThere(session, endpoint, token)) return true;
     session.noteFailure("UNLOCK", endpoint, answer);
     return false;
 }
@@ -241,13 +250,7 @@ StoreLock::Had StoreLock::attempt(CXDAVManager::Impl& client, const std::optiona
         }
         client.tokens.expectUnheard(where, mark);
         const StandingLocks standing = locksThere(client.session, *_endpoint);
-        if (!standing.answered) {
-            // Neither body could be read, and the head of the answer may have brought a lock all the same.
-            const LockToken token = tokenInHeader(answer);
-            const bool isGivenBack = isPlausible(token) && release(client.session, *_endpoint, token);
-            if (isGivenBack) client.tokens.lookedForUnheard(where);
-            return failed(isGivenBack ? Had::none : Had::unknown);
-        }
+        if (!standing.answered) return failed(Had::unknown);
         client.tokens.lookedForUnheard(where);
         if (const auto own = unheardLock(standing, client.tokens, where); own && keep(*own)) return Had::lock;
         if (!standing.isThere || !standing.locks.empty()) return failed(Had::none);

@@ -155,6 +155,23 @@ TEST_F(Locks, WhatKilledRunsHoldIsGivenBackWhetherTheyKnewTheirTokenOrNot) {
     }
 }
 
+// The release was carried out and its answer lost. httpd refuses a second one with 400.
+TEST_F(Locks, ALockThatIsGoneAlreadyIsNotedNoLonger) {
+    auto mine = lock(alice);
+    ASSERT_TRUE(mine->tryLock());
+    const std::string note = stateDirectory() + "/locks-of-this-test";
+    std::filesystem::copy(stateDirectory() + "/locks", note);
+    mine->unlock();
+    std::filesystem::remove_all(stateDirectory() + "/locks");
+    std::filesystem::rename(note, stateDirectory() + "/locks");
+    giveLocksOfThisProcessTo(kEndedRun);
+    releaseLocksOfEndedRuns(second.manager);
+    EXPECT_TRUE(std::filesystem::is_empty(stateDirectory() + "/locks")) << second.wire->text();
+    second.wire->clear();
+    releaseLocksOfEndedRuns(second.manager);
+    EXPECT_EQ(second.wire->methods(), "") << "nothing is known of any more";
+}
+
 // The kernel's tables still name it, and nobody knows for how long: that is up to its parent.
 TEST_F(Locks, AKilledRunThatItsParentHasNotWaitedForHoldsNothingAnyMore) {
     ChildProcess run(std::vector<std::string>{"sleep", "60"});
