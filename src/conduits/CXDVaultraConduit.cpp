@@ -310,17 +310,23 @@ void CXDVaultraConduit::mendOwnTree(const Dictionary& prior, const Dictionary& s
     if (written > 0) CXLog("The store has lost the files of %@ contacts, which are written again.", written);
 }
 
-// Groups that name a contact which is nowhere.
+// Groups that name a contact or a group which is nowhere, or a group that the owner's database cannot take in.
 void CXDVaultraConduit::takeNamesAloneOut(Dictionary prior, const Dictionary& state) {
-    const Dictionary alone = namesAlone(prior, state, [&](const UniqueId& person) {
-        return _world.rolvane.recordForUniqueId(cxUIDWithTableName(person, kCXPersonTable)) != nullptr;
+    const Dictionary alone = namesAlone(
+        prior, state, [&](const UniqueId& name) { return _world.rolvane.recordForUniqueId(name) != nullptr; });
+    const Dictionary circles = closingCircles(state, [&](const UniqueId& name) {
+        std::vector<UniqueId> inner;
+        if (const auto group = std::dynamic_pointer_cast<CXGroup>(_world.rolvane.recordForUniqueId(name)))
+            inner = group->subgroupUniqueIds();
+        for (UniqueId& each : inner) each = cxUIDWithTableName(each, kCXGroupTable);
+        return inner;
     });
-    const CXDChangeRecords removals = removalOfNamesAlone(prior, alone);
+    const CXDChangeRecords removals = removalOfNamesAlone(prior, alone, circles);
     _leftovers.insert(_leftovers.end(), removals.begin(), removals.end());
-    if (alone.empty())
+    if (const Dictionary all = namesTogether(alone, circles); all.empty())
         prior.remove(kNamesAlone);
     else
-        prior.set(kNamesAlone, alone);
+        prior.set(kNamesAlone, all);
 }
 
 // True when nothing had to be mended, or has been long since. When the last of it is on the store: where nobody but the
@@ -362,7 +368,7 @@ CXDChangeRecords CXDVaultraConduit::changeRecords() {
 // written. Nobody else takes it in: it would stay behind when its file goes. From the own tree it is taken away.
 // (Where single groups are published, the list of everybody does not name all who have joined one since.)
 void CXDVaultraConduit::leaveUnlistedOut(CXDChangeRecords& records) {
-    std::map<UserName, ListedContacts> lists;
+    std::map<UserName, ListedNames> lists;
     std::set<std::pair<UserName, UniqueId>> joining;
     for (const CXDChangeRecordPtr& record : records)
         if (record->type() == CXDAddRecordToGroup && record->person() && record->user() &&
@@ -374,7 +380,8 @@ void CXDVaultraConduit::leaveUnlistedOut(CXDChangeRecords& records) {
         if (read == _read.end()) return false;
         if (joining.contains({*record->user(), *record->person()})) return false;
         const UniqueId shared = cxNormalizedUID(*record->person());
-        if (lists.try_emplace(*record->user(), read->second).first->second.contains(shared)) return false;
+        if (lists.try_emplace(*record->user(), read->second, kMemberUIDState).first->second.contains(shared))
+            return false;
         if (_world.rolvane.recordForUniqueId(*record->person())) return false;
         CXDLog("Not listed, and left out: %@", record);
         if (record->user() == kSelf && _isWrittenByOthers) _leftovers.push_back(removalOfContact(shared));
@@ -512,17 +519,26 @@ bool CXDVaultraConduit::updateRecord(CXDChangeRecord& record, int& code) {
     const auto base = baseLocationOf(record);
     if (!base || !record.person()) return false;
     const UserName user = record.user().value_or(UserName());
-    const ContactWrites::Place place{user, layout::contactLocation(*base, *record.person()), inDatabase(record),
-                                     mergesInto(user)};
+    const UniqueId shared = cxNormalizedUID(*record.person()), everybody{std::string(layout::kAllGroup)};
+    const ContactWrites::Place place{user,
+                                     layout::contactLocation(*base, *record.person()),
+                                     inDatabase(record),
+                                     mergesInto(user),
+                                     layout::groupLocation(*base, everybody),
+                                     [&] {
+                                         const Dictionary list =
+                                             engine().knownGroupState(kConduitVaultra, user, everybody);
+                                         return list[kMemberUIDState].array().containsString(shared.str());
+                                     }};
     return _writes.write(place, contentOf(record), code);
 }
 
-// A shared identifier means the owner's own contact in the own tree, and in another one the copy that came from there.
+// A shared identifier means the owner's own contact in the own tree, and in another one the copy that came from there,
+// also when somebody has deleted that meanwhile.
 UniqueId CXDVaultraConduit::inDatabase(const CXDChangeRecord& record) {
     const UniqueId own = cxUIDWithTableName(*record.person(), kCXPersonTable);
     if (record.changeMadeByDataOwner()) return own;
-    UniqueId copy = cxUIDWithTableName(own, kCXSubscribedPersonTable);
-    return _world.rolvane.personRow(copy) ? copy : own;
+    return cxUIDWithTableName(own, kCXSubscribedPersonTable);
 }
 
 // Where nobody else writes there is nothing to merge with. What an older copy of a tree holds is no news.
@@ -534,6 +550,7 @@ bool CXDVaultraConduit::mergesInto(const UserName& user) {
 CXDChangeRecords CXDVaultraConduit::takeMerged() {
     CXDChangeRecords updates;
     for (const ContactWrites::Merged& merged : _writes.takeMerged()) {
+        if (!_world.rolvane.personRow(merged.place.uniqueId)) continue; // deleted meanwhile, and so it stays
         Dictionary content = merged.contact.mutableCopy();
         const auto base = baseLocationForUser(realUserFromUser(merged.place.user));
         if (merged.place.user != kSelf && base)

@@ -3,8 +3,10 @@
 #include "conduits/CXDVaultraConduit.h"
 #include "contacts/Constants.h"
 #include "contacts/ContactMerge.h"
+#include "contacts/Identifier.h"
 #include "foundation/Log.h"
 #include "foundation/PropertyList.h"
+#include "model/PayloadKeys.h"
 #include "store/CXDAVManager.h"
 
 #include <utility>
@@ -13,6 +15,7 @@ namespace rolvane {
 namespace {
 
 constexpr int kOk = 200;
+constexpr int kForbidden = 403;
 constexpr int kChangedMeanwhile = 412;
 constexpr int kAttempts = 4;
 
@@ -46,14 +49,36 @@ bool ContactWrites::write(const Place& place, const Dictionary& ours, int& code)
             const auto there = _manager.readVersion(place.location, CXDVaultraConduit::kSecureRecordWrites, &code);
             if (there.failed) return false;
             const bool isKnown = !there.contact || there.isKnown;
-            done =
-                isKnown ? put(place, ours, code) : writeMerged(place, ours, *there.contact, there.lastModified, code);
+            if (!there.contact)
+                done = writeWhereNoneIs(place, ours, code);
+            else
+                done = isKnown ? put(place, ours, code)
+                               : writeMerged(place, ours, *there.contact, there.lastModified, code);
             if (!done && !isKnown) _manager.forgetVersion(place.location); // it was read, and nobody has it
             if (!done && code != kChangedMeanwhile) return false;
         }
     }
     if (done) _rolvane.setCommonVersion(place.uniqueId, encoded(ours));
     return done;
+}
+
+// The list of everybody says whether the store has lost the file or somebody has deleted the contact. Without the list
+// the edit waits.
+bool ContactWrites::writeWhereNoneIs(const Place& place, const Dictionary& ours, int& code) {
+    if (place.wasListed && place.wasListed()) {
+        const auto list = _manager.dictionaryAtURL(place.list, CXDVaultraConduit::kSecureRecordWrites, &code);
+        const Value members = list ? (*list)[kMemberUIDState] : Value();
+        if (!members.isArray()) {
+            if (code == kForbidden) code = 0; // a refusal of the question is none of the edit
+            return false;
+        }
+        if (!members.array().containsString(cxNormalizedUID(place.uniqueId).str())) {
+            CXLog("%@ has been deleted by somebody else, and is not written any more", place.location);
+            _manager.forgetVersion(place.location);
+            return true;
+        }
+    }
+    return put(place, ours, code);
 }
 
 bool ContactWrites::writeMerged(const Place& place, const Dictionary& ours, const Dictionary& theirs,

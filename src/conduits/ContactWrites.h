@@ -32,12 +32,15 @@ public:
     ContactWrites(CXDAVManager& manager, CXRolvane& rolvane) : _manager(manager), _rolvane(rolvane) {}
 
     struct Place {
-        UserName user;     // of the tree
-        Url location;      // of the contact's file
-        UniqueId uniqueId; // of the contact in the database
-        bool merges;       // others may have written there, and what they wrote may be taken in here
+        UserName user;                   // of the tree
+        Url location;                    // of the contact's file
+        UniqueId uniqueId;               // of the contact in the database
+        bool merges;                     // others may have written there, and what they wrote may be taken in here
+        Url list;                        // the tree's list of everybody
+        std::function<bool()> wasListed; // whether that list is known to have named the contact; asked at most once
     };
-    // True when the store has the content afterwards, alone or merged. `code`: the last answer's status; 412 when
+    // True when the store has the content afterwards, alone or merged, and when somebody else has deleted the contact:
+    // its file is gone and the list that named it does not any more. `code`: the last answer's status; 412 when
     // somebody else was faster several times.
     bool write(const Place& place, const Dictionary& ours, int& code);
 
@@ -52,6 +55,7 @@ public:
 
 private:
     bool put(const Place& place, const Dictionary& content, int& code);
+    bool writeWhereNoneIs(const Place& place, const Dictionary& ours, int& code);
     bool writeMerged(const Place& place, const Dictionary& ours, const Dictionary& theirs,
                      const std::optional<Date>& theirDate, int& code);
 

@@ -25,10 +25,18 @@ bool isGroup(std::string_view name) {
     return name.ends_with("CXGroup");
 }
 
-std::unordered_set<std::string> groupsThatAreListed(const Dictionary& state) {
+Array groupsOfEverybody(const Dictionary& state) {
+    return state[kEverybody].dictionary()[kSubgroupUIDState].array();
+}
+
+// The list of everybody says which groups there are, where it names any. Two people may delete a group and nest it at
+// the same time, so another group can name one that is no more. Where single groups are published, that list may name
+// none.
+std::unordered_set<std::string> groupsThatAreListed(const Dictionary& prior, const Dictionary& current) {
+    const bool everybodySays = !groupsOfEverybody(prior).empty() || !groupsOfEverybody(current).empty();
     std::unordered_set<std::string> listed;
-    for (const auto& [name, group] : state)
-        if (isGroup(name))
+    for (const auto& [name, group] : current)
+        if (everybodySays ? name == kEverybody : isGroup(name))
             for (const Value& subgroup : group.dictionary()[kSubgroupUIDState].array())
                 listed.insert(subgroup.string());
     return listed;
@@ -40,7 +48,7 @@ bool hasLostAGroup(const Dictionary& prior, const Dictionary& current) {
         if (isGroup(name) && name != kEverybody && !group.dictionary().empty() && current[name].dictionary().empty())
             missing.push_back(name);
     if (missing.empty()) return false;
-    const auto listed = groupsThatAreListed(current);
+    const auto listed = groupsThatAreListed(prior, current);
     return std::any_of(missing.begin(), missing.end(), [&](const auto& name) { return listed.contains(name); });
 }
 
@@ -136,34 +144,86 @@ CXDChangeRecords removalOfUnlisted(const Dictionary& prior, const Dictionary& cu
 }
 
 Dictionary namesAlone(const Dictionary& prior, const Dictionary& current,
-                      const std::function<bool(const UniqueId& person)>& isHere) {
+                      const std::function<bool(const UniqueId& name)>& isHere) {
     Dictionary alone;
     if (!current[kEverybody].dictionary().contains(kMemberUIDState)) return alone;
-    const ListedContacts listed(current), listedBefore(prior);
+    const ListedNames people(current, kMemberUIDState), peopleBefore(prior, kMemberUIDState);
+    const ListedNames groups(current, kSubgroupUIDState), groupsBefore(prior, kSubgroupUIDState);
     const Dictionary files = current[kPeopleState].dictionary()[kMemberUIDState].dictionary();
     for (const auto& [name, state] : current) {
         if (!isGroup(name) || name == kEverybody) continue;
         Array names;
-        for (const Value& member : state.dictionary()[kMemberUIDState].array()) {
-            const UniqueId person(member.string());
-            if (listed.contains(person) || files.contains(person.str())) continue;
-            if (listedBefore.contains(person) || !isHere(person)) names.append(member);
-        }
+        const auto collect = [&](const char* list, const ListedNames& listed, const ListedNames& before,
+                                 const auto& isThere) {
+            for (const Value& each : state.dictionary()[list].array()) {
+                const UniqueId uid(each.string());
+                if (!listed.contains(uid) && !isThere(uid) && (before.contains(uid) || !isHere(uid)))
+                    names.append(each);
+            }
+        };
+        collect(kMemberUIDState, people, peopleBefore, [&](const UniqueId& uid) { return files.contains(uid.str()); });
+        if (!groups.empty() || !groupsBefore.empty()) // else single groups are published, and the list names none
+            collect(kSubgroupUIDState, groups, groupsBefore,
+                    [&](const UniqueId& uid) { return !current[uid.str()].dictionary().empty(); });
         if (!names.empty()) alone.set(name, names);
     }
     return alone;
 }
 
-CXDChangeRecords removalOfNamesAlone(const Dictionary& prior, const Dictionary& alone) {
+Dictionary closingCircles(const Dictionary& current,
+                          const std::function<std::vector<UniqueId>(const UniqueId& group)>& subgroupsHere) {
+    const auto holdsHere = [&](const UniqueId& outer, const UniqueId& wanted) {
+        std::unordered_set<UniqueId> seen;
+        std::vector<UniqueId> next{outer};
+        while (!next.empty()) {
+            const UniqueId group = std::move(next.back());
+            next.pop_back();
+            if (group == wanted) return true;
+            if (!seen.insert(group).second) continue;
+            for (UniqueId& inner : subgroupsHere(group)) next.push_back(std::move(inner));
+        }
+        return false;
+    };
+    Dictionary closing;
+    for (const auto& [name, state] : current) {
+        if (!isGroup(name) || name == kEverybody) continue;
+        Array names;
+        for (const Value& inner : state.dictionary()[kSubgroupUIDState].array())
+            if (holdsHere(UniqueId(inner.string()), UniqueId(name))) names.append(inner);
+        if (!names.empty()) closing.set(name, names);
+    }
+    return closing;
+}
+
+CXDChangeRecords removalOfNamesAlone(const Dictionary& prior, const Dictionary& alone, const Dictionary& circles) {
     CXDChangeRecords removals;
-    if (alone.empty()) return removals;
-    const ListedContacts listedBefore(prior);
+    if (alone.empty() && circles.empty()) return removals;
+    const ListedNames peopleBefore(prior, kMemberUIDState), groupsBefore(prior, kSubgroupUIDState);
     const Dictionary before = prior[kNamesAlone].dictionary();
+    const auto remove = [&](const std::string& group, const Value& name) {
+        removals.push_back(ownersChange(isGroup(name.string()) ? CXDRemoveGroupFromGroup : CXDRemoveRecordFromGroup,
+                                        UniqueId(name.string()), UniqueId(group)));
+    };
     for (const auto& [group, names] : alone)
+        for (const Value& name : names.array()) {
+            const UniqueId uid(name.string());
+            if (peopleBefore.contains(uid) || groupsBefore.contains(uid) ||
+                before[group].array().containsString(name.string()))
+                remove(group, name);
+        }
+    for (const auto& [group, names] : circles)
         for (const Value& name : names.array())
-            if (listedBefore.contains(UniqueId(name.string())) || before[group].array().containsString(name.string()))
-                removals.push_back(ownersChange(CXDRemoveRecordFromGroup, UniqueId(name.string()), UniqueId(group)));
+            if (before[group].array().containsString(name.string())) remove(group, name);
     return removals;
+}
+
+Dictionary namesTogether(const Dictionary& alone, const Dictionary& circles) {
+    Dictionary all = Value(alone).deepMutableCopy().dictionary();
+    for (const auto& [group, names] : circles) {
+        Array together = all.arrayFor(group);
+        for (const Value& name : names.array()) together.append(name);
+    }
+    return all;
 }
 
 CXDChangeRecordPtr removalOfContact(const UniqueId& person) {
@@ -180,8 +240,8 @@ std::vector<UniqueId> contactsThatAreMissing(const Dictionary& current) {
     return missing;
 }
 
-ListedContacts::ListedContacts(const Dictionary& current)
-    : _list(current[kEverybody].dictionary()[kMemberUIDState].array()) {
+ListedNames::ListedNames(const Dictionary& state, const char* list)
+    : _list(state[kEverybody].dictionary()[list].array()) {
     _names.reserve(_list.count());
     for (const Value& member : _list)
         if (const std::string* name = member.stringIf()) _names.insert(*name);

@@ -23,7 +23,7 @@
 namespace rolvane {
 
 inline constexpr const char* kTreeDates = "TreeDates";
-inline constexpr const char* kNamesAlone = "NamesAlone"; // as namesAlone gives them
+inline constexpr const char* kNamesAlone = "NamesAlone"; // as namesTogether gives them
 
 struct TreeCondition {
     enum class Kind {
@@ -57,15 +57,24 @@ CXDChangeRecords removalOfLeftovers(const Dictionary& prior, const Dictionary& c
 // longer, and still lies there: another writer has taken it out, and a change that was under way brought its file back.
 CXDChangeRecords removalOfUnlisted(const Dictionary& prior, const Dictionary& current);
 
-// Whom groups name though neither the list of everybody nor a file does: group -> array of people. Somebody has put the
-// contact there while somebody else deleted it; or a new contact's file is still to come. `isHere`: the owner's
-// database has the contact; one whom the list has lost since `prior` is about to leave it.
+// The contacts and groups that groups name though neither the list of everybody nor a file does: group -> array of
+// names. Somebody has put them there while somebody else deleted them; or a new one's file is still to come. `isHere`:
+// the owner's database has it; one that the list has lost since `prior` is about to leave it.
 Dictionary namesAlone(const Dictionary& prior, const Dictionary& current,
-                      const std::function<bool(const UniqueId& person)>& isHere);
+                      const std::function<bool(const UniqueId& name)>& isHere);
 
-// The changes of the owner's that take such names out of their groups: whom the list of everybody has lost since
-// `prior`, and who stood alone at the last visit already ("NamesAlone" of `prior`).
-CXDChangeRecords removalOfNamesAlone(const Dictionary& prior, const Dictionary& alone);
+// Groups within groups that the owner's database cannot take in: there, the inner one holds the outer one already, over
+// others perhaps. Two people have nested them at the same time; or somebody is turning them round at this moment.
+// Group -> array of groups. `subgroupsHere`: what a group holds in the owner's database, by shared names.
+Dictionary closingCircles(const Dictionary& current,
+                          const std::function<std::vector<UniqueId>(const UniqueId& group)>& subgroupsHere);
+
+// The changes of the owner's that take such names out of their groups: those alone that the list of everybody has lost
+// since `prior`, and all that stood so at the last visit already ("NamesAlone" of `prior`).
+CXDChangeRecords removalOfNamesAlone(const Dictionary& prior, const Dictionary& alone, const Dictionary& circles = {});
+
+// Both together, as they are remembered.
+Dictionary namesTogether(const Dictionary& alone, const Dictionary& circles);
 
 // The change that takes one contact off the store.
 CXDChangeRecordPtr removalOfContact(const UniqueId& person);
@@ -74,11 +83,13 @@ CXDChangeRecordPtr removalOfContact(const UniqueId& person);
 // none is missing and none is there besides.
 std::vector<UniqueId> contactsThatAreMissing(const Dictionary& current);
 
-// The contacts that the list of everybody names, to be asked for many.
-class ListedContacts {
+// What the list of everybody names, to be asked for many.
+class ListedNames {
 public:
-    explicit ListedContacts(const Dictionary& current);
-    bool contains(const UniqueId& person) const { return _names.contains(person.str()); }
+    // `list`: its contacts (kMemberUIDState) or its groups (kSubgroupUIDState).
+    ListedNames(const Dictionary& state, const char* list);
+    bool contains(const UniqueId& name) const { return _names.contains(name.str()); }
+    bool empty() const { return _names.empty(); }
 
 private:
     Array _list;

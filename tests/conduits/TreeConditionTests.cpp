@@ -125,6 +125,68 @@ TEST(TreeCondition, AGroupThatIsGoneAndStillNamedIsALossAndADeletedOneIsNot) {
     EXPECT_EQ(kindOf(tree(), current), Kind::sound);
 }
 
+TEST(TreeCondition, AGroupThatTheListOfEverybodyDoesNotNameWasDeletedThoughAnotherGroupNamesIt) {
+    const auto with = [](Array listed, bool isThere) {
+        Dictionary state = tree();
+        state["AllCXGroup"].dictionary().set(kSubgroupUIDState, std::move(listed));
+        state.set("H:CXGroup", Dictionary{{kMemberUIDState, Array()}, {kSubgroupUIDState, Array{"G:CXGroup"}}});
+        if (!isThere) state.remove("G:CXGroup");
+        return state;
+    };
+    const Dictionary before = with(Array{"G:CXGroup", "H:CXGroup"}, true);
+    EXPECT_EQ(kindOf(before, with(Array{"H:CXGroup"}, false)), Kind::sound);
+    EXPECT_EQ(kindOf(with(Array{"H:CXGroup"}, true), with(Array{"H:CXGroup"}, false)), Kind::sound)
+        << "seen while it was being deleted";
+    EXPECT_EQ(kindOf(before, with(Array{"G:CXGroup", "H:CXGroup"}, false)), Kind::lostAGroup);
+    EXPECT_EQ(kindOf(with(Array(), true), with(Array(), false)), Kind::lostAGroup)
+        << "where single groups are published the list of everybody need not name any";
+}
+
+TEST(TreeCondition, AGroupThatIsNowhereIsTakenOutOfTheGroupsThatNameIt) {
+    const auto nobody = [](const UniqueId&) { return false; };
+    Dictionary before = tree(), now = without(tree(), "G:CXGroup");
+    now["AllCXGroup"].dictionary().set(kSubgroupUIDState, Array{"H:CXGroup"});
+    now.set("H:CXGroup", Dictionary{{kMemberUIDState, Array()}, {kSubgroupUIDState, Array{"G:CXGroup"}}});
+    const Dictionary alone = namesAlone(before, now, nobody);
+    EXPECT_EQ(alone, (Dictionary{{"H:CXGroup", Array{"G:CXGroup"}}}));
+    const CXDChangeRecords removals = removalOfNamesAlone(before, alone);
+    ASSERT_EQ(removals.size(), 1u) << "the list named it before";
+    EXPECT_EQ(removals[0]->type(), CXDRemoveGroupFromGroup);
+    EXPECT_EQ(removals[0]->person(), UniqueId("G:CXGroup"));
+    EXPECT_EQ(removals[0]->group(), UniqueId("H:CXGroup"));
+    EXPECT_TRUE(removalOfNamesAlone(now, namesAlone(now, now, nobody)).empty()) << "it may be still to come";
+    Dictionary seen = now;
+    seen.set(kNamesAlone, alone);
+    EXPECT_EQ(removalOfNamesAlone(seen, namesAlone(seen, now, nobody)).size(), 1u) << "it does not come";
+    EXPECT_TRUE(namesAlone(now, now, [](const UniqueId&) { return true; }).empty()) << "the owner has it";
+    now["AllCXGroup"].dictionary().remove(kSubgroupUIDState);
+    EXPECT_TRUE(namesAlone(now, now, nobody).empty()) << "single groups are published";
+}
+
+TEST(TreeCondition, WhatClosesACircleInTheOwnersDatabaseIsTakenOutWhenItStandsForTwoVisits) {
+    std::map<UniqueId, std::vector<UniqueId>> here{{UniqueId("A:CXGroup"), {UniqueId("B:CXGroup")}},
+                                                   {UniqueId("B:CXGroup"), {UniqueId("C:CXGroup")}}};
+    const auto inner = [&](const UniqueId& group) { return here[group]; };
+    Dictionary state = tree();
+    const auto holds = [&](const char* group, const Array& groups) {
+        state.set(group, Dictionary{{kSubgroupUIDState, groups}});
+    };
+    holds("A:CXGroup", {"B:CXGroup"});
+    holds("B:CXGroup", {"C:CXGroup"});
+    EXPECT_TRUE(closingCircles(state, inner).empty());
+    holds("C:CXGroup", {"A:CXGroup", "D:CXGroup"});
+    const Dictionary circles = closingCircles(state, inner);
+    EXPECT_EQ(circles, (Dictionary{{"C:CXGroup", Array{"A:CXGroup"}}}));
+    EXPECT_TRUE(removalOfNamesAlone(state, {}, circles).empty()) << "somebody is turning them round";
+    state.set(kNamesAlone, namesTogether({}, circles));
+    const CXDChangeRecords removals = removalOfNamesAlone(state, {}, circles);
+    ASSERT_EQ(removals.size(), 1u);
+    EXPECT_EQ(removals[0]->person(), UniqueId("A:CXGroup"));
+    EXPECT_EQ(removals[0]->group(), UniqueId("C:CXGroup"));
+    here[UniqueId("A:CXGroup")].clear();
+    EXPECT_TRUE(closingCircles(state, inner).empty()) << "the owner has taken the other half back";
+}
+
 TEST(TreeCondition, ContactsWithoutASingleFileAreALoss) {
     Dictionary current = without(tree(), kPeopleState);
     EXPECT_EQ(kindOf(tree(), current), Kind::lostContacts);

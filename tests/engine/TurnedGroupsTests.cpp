@@ -175,6 +175,24 @@ TEST_F(TurnedGroups, ACircleOnTheStoreIsTakenInAsFarAsItIsNone) {
     expectNested(bob, reversed(chain));
 }
 
+// Each nests one into the other, and does not know of the other's doing. The owner's stays.
+TEST_F(TurnedGroups, OfTwoThatAreNestedIntoOneAnotherTheOwnersHalfStaysEverywhere) {
+    makeGroups("ab");
+    nest(alice, {});
+    alice.pass();
+    bob.pass();
+    groupAt(alice, chain[0])->addSubgroup(groupAt(alice, chain[1]));
+    alice.application->save();
+    groupAt(bob, chain[1])->addSubgroup(groupAt(bob, chain[0]));
+    bob.application->save();
+    for (int i = 0; i < 4; ++i)
+        for (Participant* each : {&bob, &alice}) each->pass();
+    expectNested(alice, chain);
+    expectNested(bob, chain);
+    EXPECT_EQ(copies(), alice.view()) << log.text();
+    for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
+}
+
 // -- others that were done with and had no effect
 
 // The choices for somebody who could not be read: remembered, they would be missing at the next look, as if the reader

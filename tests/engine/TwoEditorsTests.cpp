@@ -174,6 +174,29 @@ TEST_F(TwoEditors, WhoIsFasterBetweenReadingAndWritingIsMergedToo) {
     expectEqualAndQuiet();
 }
 
+TEST_F(TwoEditors, AContactThatIsDeletedBeforeItIsMergedDoesNotBecomeThePersonsOwn) {
+    edit(alice, kCXNicknameProperty, "Countess");
+    alice.pass();
+    edit(bob, kCXOrganizationProperty, "Engine");
+    std::atomic<bool> isDeleted = false;
+    bob.wire->intercept([&](const HttpRequest& request) -> std::optional<HttpResponse> {
+        if (request.method == "LOCK" && !isDeleted.exchange(true)) { // the edit is on its way
+            bob.application->removeRecord(bob.copyOf(people[0]));
+            bob.application->save();
+        }
+        return std::nullopt;
+    });
+    bob.pass();
+    ASSERT_TRUE(isDeleted) << bob.wire->text();
+    EXPECT_EQ(bob.database->countPeople(RemoteLocation("")), 0u) << log.text();
+    bob.database->deliverExternalChanges();
+    settle();
+    EXPECT_EQ(bob.database->countPeople(RemoteLocation("")), 0u) << log.text();
+    EXPECT_FALSE(person(bob));
+    EXPECT_FALSE(alice.application->recordForUniqueId(people[0]->uniqueId())) << log.text();
+    EXPECT_EQ(copies(), alice.view()) << log.text();
+}
+
 // -- thousands of rounds, of which the suite makes a few
 
 namespace {

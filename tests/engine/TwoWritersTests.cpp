@@ -209,6 +209,38 @@ TEST_F(TwoWriters, AContactWhoseDeletionWaitsDoesNotComeBackWithSomebodysEdit) {
     for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
 }
 
+// The writer's daemon could not look at the tree, and sends what has been edited without knowing of the deletion.
+TEST_F(TwoWriters, AnEditThatGoesOutWithoutALookAtTheTreeDoesNotBringADeletedContactBack) {
+    bob.pass();
+    alice.pass();
+    for (const bool byOwner : {true, false}) {
+        SCOPED_TRACE(byOwner ? "deleted by the owner" : "deleted by the writer");
+        const CXPersonRef person = people[byOwner ? 0 : 1];
+        const UniqueId gone = person->uniqueId();
+        Participant &first = byOwner ? alice : bob, &second = byOwner ? bob : alice;
+        first.application->removeRecord(byOwner ? person : bob.copyOf(person));
+        first.application->save();
+        first.pass();
+        ASSERT_FALSE(std::filesystem::exists(fileOf(gone)));
+        (byOwner ? bob.copyOf(person) : person)->setValue(Value("Late"), kCXNicknameProperty);
+        second.application->save();
+        std::atomic<bool> fails = true;
+        second.wire->intercept([&](const HttpRequest& request) {
+            return fails && request.method == "PROPFIND" ? std::optional(answerOf(503)) : std::nullopt;
+        });
+        second.pass();
+        EXPECT_FALSE(std::filesystem::exists(fileOf(gone))) << log.text();
+        EXPECT_TRUE(second.engine->getPendingChanges().empty()) << log.text();
+        fails = false;
+        for (int round = 0; round < 2; ++round)
+            for (Participant* each : {&second, &first}) each->pass();
+        EXPECT_FALSE(alice.application->recordForUniqueId(gone)) << log.text();
+        EXPECT_FALSE(std::filesystem::exists(fileOf(gone))) << log.text();
+        EXPECT_EQ(copies(), alice.view());
+        for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
+    }
+}
+
 // A writer who did not know that the contact is deleted has written it once more.
 TEST_F(TwoWriters, AContactThatLiesInTheTreeAndIsInNoListIsTakenInByNobodyAndTakenAway) {
     bob.pass();
