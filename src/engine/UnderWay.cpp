@@ -73,6 +73,8 @@ public:
     void person(const UniqueId& uid) {
         if (_holdings.person(uid)) return;
         add(CXDDeleteRecord, uid, std::nullopt);
+        const UniqueId everybody(kCXAllGroupUID); // whose list it may have reached, too
+        if (!_withdrawn.contains(everybody)) add(CXDRemoveRecordFromGroup, uid, everybody);
         _gone.insert(uid.str());
     }
 

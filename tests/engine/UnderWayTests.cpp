@@ -68,7 +68,8 @@ TEST_F(LeftAdrift, APersonWhoWasWrittenAndNeverListedIsRemovedAfterLeaving) {
     EXPECT_THAT(pass(), IsEmpty()) << "the person is there";
     world.rolvane->removeRecord(world.rolvane->recordForUniqueId(UniqueId(kPerson)));
     world.rolvane->save();
-    EXPECT_THAT(pass(), UnorderedElementsAre("P:CXPerson 260"));
+    EXPECT_THAT(pass(), UnorderedElementsAre("P:CXPerson 260", "AllCXGroup 3")) << "and out of the list";
+    EXPECT_EQ(written[kMemberRemoves], Value(Array{kPerson})) << "which may have been written, too";
     EXPECT_THAT(pass(), IsEmpty()) << "once";
     EXPECT_FALSE(world.stored(kCXDUnderWay));
 }
