@@ -250,7 +250,13 @@ StoreLock::Had StoreLock::attempt(CXDAVManager::Impl& client, const std::optiona
         }
         client.tokens.expectUnheard(where, mark);
         const StandingLocks standing = locksThere(client.session, *_endpoint);
-        if (!standing.answered) return failed(Had::unknown);
+        if (!standing.answered) {
+            // Neither body could be read, and the head of the answer may have brought a lock all the same.
+            const LockToken token = tokenInHeader(answer);
+            const bool isGivenBack = isPlausible(token) && release(client.session, *_endpoint, token);
+            if (isGivenBack) client.tokens.lookedForUnheard(where);
+            return failed(isGivenBack ? Had::none : Had::unknown);
+        }
         client.tokens.lookedForUnheard(where);
         if (const auto own = unheardLock(standing, client.tokens, where); own && keep(*own)) return Had::lock;
         if (!standing.isThere || !standing.locks.empty()) return failed(Had::none);

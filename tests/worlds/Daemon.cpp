@@ -4,6 +4,7 @@
 #include "conduits/CXDVaultraConduit.h"
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "store/StoreLock.h"
 
 #include <unistd.h>
 
@@ -24,7 +25,8 @@ void Daemon::End::end(int status) {
 }
 
 Daemon::Daemon(const Person& person, const Weather& weather, Report& report)
-    : _report(report), _wire(std::make_shared<FaultyTransport>(signedIn(person), weather, report)),
+    : _report(report), _clock(weather.later),
+      _wire(std::make_shared<FaultyTransport>(signedIn(person), weather, report)),
       _manager(person.account, _wire, CXDAVManager::VersionsFile{person.directory + "/versions"}),
       _preferences(person.directory + "/preferences.db"), _end(report), _account(person),
       _withdrawn(person.directory + "/withdrawn"), _login(person.account.user.str() + "login") {
@@ -32,21 +34,24 @@ Daemon::Daemon(const Person& person, const Weather& weather, Report& report)
         _database = std::make_unique<CXRolvane>(CXRolvane::Options{
             .path = person.database(), .program = "RolvaneManager", .center = &_center, .runLoop = &_loop});
         _database->recoverShareCount(_preferences);
-        _engine = std::make_unique<CXDSyncEngine>(
-            EngineCollaborators{.rolvane = *_database,
-                                .preferences = _preferences,
-                                .distributed = _distributed,
-                                .runLoop = _loop,
-                                .clock = Clock::system(),
-                                .progress = _progress,
-                                .processEnd = _end,
-                                .account = _account,
-                                .idleExit = _idleExit,
-                                .makeLock = [this](const Url& url) { return makeStoreLock(_manager, url); },
-                                .makeConduits = [this](ConduitEngine& owner) { return conduits(owner); },
-                                .loginName = _login,
-                                .renewalSleep = nullptr,
-                                .releaseLocksOfEndedRuns = [this] { releaseLocksOfEndedRuns(_manager); }});
+        _engine = std::make_unique<CXDSyncEngine>(EngineCollaborators{
+            .rolvane = *_database,
+            .preferences = _preferences,
+            .distributed = _distributed,
+            .runLoop = _loop,
+            .clock = _clock,
+            .progress = _progress,
+            .processEnd = _end,
+            .account = _account,
+            .idleExit = _idleExit,
+            .makeLock =
+                [this](const Url& url) {
+                    return std::make_shared<StoreLock>(_manager.impl(), url, LockLedger::user(), _clock);
+                },
+            .makeConduits = [this](ConduitEngine& owner) { return conduits(owner); },
+            .loginName = _login,
+            .renewalSleep = nullptr,
+            .releaseLocksOfEndedRuns = [this] { releaseLocksOfEndedRuns(_manager); }});
     });
 }
 

@@ -48,6 +48,11 @@ private:
     struct Reachable : CXNetworkController {
         bool canReachAddress(const std::string&) override { return true; }
     };
+    struct LaterClock : Clock {
+        explicit LaterClock(double seconds) : later(seconds) {}
+        Date now() const override { return system().now().addingSeconds(later); }
+        const double later;
+    };
     struct Quiet : UserAlert {
         void show(const Text&) override {}
         void tell(const Text&) override {}
@@ -76,6 +81,7 @@ private:
     };
 
     Report& _report;
+    const LaterClock _clock;
     std::shared_ptr<FaultyTransport> _wire;
     CXDAVManager _manager;
     NotificationCenter _center;

@@ -28,10 +28,7 @@ Cells cellsOf(const CXPerson& person, std::vector<std::string>& faults) {
     Cells cells;
     for (const char* property : kTexts)
         if (const Value text = person.valueForProperty(property)) cells[property] = text.string();
-    if (const auto phones = person.multiValueForProperty(kCXPhoneProperty))
-        for (const auto& phone : phones->entries())
-            if (!cells.emplace("Phone/" + rootOf(phone.value.string()), markOf(phone.value.string())).second)
-                faults.push_back(shared(person.uniqueId()) + " has " + phone.value.string() + " twice");
+    readPhones(person.multiValueForProperty(kCXPhoneProperty), shared(person.uniqueId()), cells, faults);
     return cells;
 }
 
@@ -47,6 +44,19 @@ Cells cellsOf(const CXGroup& group, std::vector<std::string>& faults) {
 }
 
 } // namespace
+
+void readPhones(const std::optional<CXMultiValue>& phones, const std::string& whose, Cells& cells,
+                std::vector<std::string>& faults) {
+    if (!phones) return;
+    std::map<std::string, std::set<std::string>> marks; // by root; two where two people have changed one
+    for (const auto& phone : phones->entries())
+        if (!marks[rootOf(phone.value.string())].insert(markOf(phone.value.string())).second)
+            faults.push_back(whose + " has " + phone.value.string() + " twice");
+    for (const auto& [root, all] : marks) {
+        std::string& cell = cells["Phone/" + root];
+        for (const std::string& mark : all) cell += (cell.empty() ? "" : " ") + mark;
+    }
+}
 
 View Editor::view(CXRolvane& database, const RemoteLocation& location) {
     View view;

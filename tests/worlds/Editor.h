@@ -18,6 +18,10 @@ struct Habits {
     bool leaveOne = false; // the last contact stays
 };
 
+// The cells of a contact's phones: all marks of one root, in order, with spaces between them.
+void readPhones(const std::optional<CXMultiValue>& phones, const std::string& whose, Cells& cells,
+                std::vector<std::string>& faults);
+
 // One person at a contact application: edits the copy of the tree in a database as a person would, at random, and
 // tells each deed once it is saved.
 class Editor {

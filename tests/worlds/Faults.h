@@ -24,6 +24,7 @@ struct Weather {
     int diskFullFrom = -1;         // write to a file of the daemon's; -1: never
     int diskFullFor = 0;           // writes
     int storeAwayFrom = -1;        // request; -1: never
+    double later = 0;              // seconds that this process's daemon lives behind the others
     bool portal = false;           // while it is away somebody else answers
     bool refusesWriter = false;    // a fault may be a refusal of a write to somebody else's tree
     std::string ownTree;           // the path of the person's own

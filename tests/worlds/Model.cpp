@@ -1,6 +1,8 @@
 #include "Model.h"
 
 #include <algorithm>
+#include <iterator>
+#include <sstream>
 
 namespace rolvane::worlds {
 
@@ -11,6 +13,17 @@ std::string othersName(const std::string& cell) {
     for (const char* kind : {"Member/", "Group/"})
         if (cell.starts_with(kind)) return cell.substr(std::string(kind).size());
     return {};
+}
+
+// A labelled value is told apart by what it says. Two changes of one that did not know of each other stand side by side
+// (contacts/ContactMerge.h), and each goes when somebody replaces it.
+bool isLabelled(const std::string& cell) {
+    return cell.starts_with("Phone/");
+}
+
+std::set<std::string> marksIn(const std::string& value) {
+    std::istringstream text(value);
+    return {std::istream_iterator<std::string>(text), {}};
 }
 
 } // namespace
@@ -30,8 +43,12 @@ void Model::take(const Deed& deed) {
     if (cell.history.empty()) cell.history[""] = 1;
     // A value that was set more than once may have been seen as it was long ago, so it is not certain to be replaced.
     const bool sawThatVery = cell.history[deed.before] == 1;
-    std::erase_if(cell.heads,
-                  [&](const Value& head) { return head.who == deed.who || (sawThatVery && head.text == deed.before); });
+    if (isLabelled(deed.cell))
+        std::erase_if(cell.heads, [&](const Value& head) { return head.text.empty() || head.text == deed.before; });
+    else
+        std::erase_if(cell.heads, [&](const Value& head) {
+            return head.who == deed.who || (sawThatVery && head.text == deed.before);
+        });
     if (!cell.heads.empty()) ++conflicts;
     cell.heads.push_back({deed.who, deed.after});
     ++cell.history[deed.after];
@@ -88,6 +105,14 @@ bool Model::mayStand(const std::string& name, const Thing& thing, const std::str
         if (cell.starts_with("Group/") && value.empty() && couldCloseACircle(name, other)) return true;
     }
     const bool any = state.anything || (!mergesProperties && thing.editors.size() > 1);
+    if (isLabelled(cell)) {
+        const std::set<std::string> marks = marksIn(value);
+        std::set<std::string> all;
+        for (const Value& head : state.heads)
+            if (!head.text.empty()) all.insert(head.text);
+        return any ? std::all_of(marks.begin(), marks.end(), [&](const auto& m) { return state.history.contains(m); })
+                   : marks == all;
+    }
     if (any && state.history.contains(value)) return true;
     return std::any_of(state.heads.begin(), state.heads.end(), [&](const Value& head) { return head.text == value; });
 }

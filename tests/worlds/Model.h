@@ -34,7 +34,7 @@ struct View {
 // - Who was made is there; who was removed by anybody is not, whatever somebody else did to it meanwhile.
 // - A part that was changed has a value that nobody has replaced knowingly. One person's later change replaces all that
 //   person's earlier ones, and what the person saw. Where two changed the same part without knowing of each other, one
-//   of both values stands.
+//   of both values stands. Labelled values are told apart by what they say: two such changes of one stand side by side.
 // - A list names nobody who is not there, and what nobody made is nowhere.
 //
 // What a store was told to refuse once may have been carried out or not: see `refused`.

@@ -1,5 +1,6 @@
 #include "StoreView.h"
 
+#include "Editor.h"
 #include "conduits/PublishedLayout.h"
 #include "contacts/CXMultiValue.h"
 #include "contacts/Constants.h"
@@ -30,16 +31,12 @@ Dictionary contentOf(const fs::path& file, View& view) {
     }
 }
 
-Cells personCells(const Dictionary& content) {
+Cells personCells(const std::string& name, const Dictionary& content, std::vector<std::string>& faults) {
     Cells cells;
     for (const char* property : {kCXFirstNameProperty, kCXLastNameProperty, kCXOrganizationProperty,
                                  kCXNicknameProperty, kCXNoteProperty, kCXJobTitleProperty})
         if (content[property]) cells[property] = content[property].string();
-    if (const auto phones = CXMultiValue::fromValue(content[kCXPhoneProperty]))
-        for (const auto& phone : phones->entries()) {
-            const std::string text = phone.value.string();
-            cells["Phone/" + text.substr(0, text.find('/'))] = text.substr(std::min(text.find('/') + 1, text.size()));
-        }
+    readPhones(CXMultiValue::fromValue(content[kCXPhoneProperty]), name + " on the store", cells, faults);
     return cells;
 }
 
@@ -50,7 +47,7 @@ void readPeople(const fs::path& people, View& view) {
         const std::string name = entry.path().filename().string();
         if (!name.ends_with(":CXPerson"))
             view.faults.push_back("the store has the file " + entry.path().lexically_relative(people).string());
-        else if (!view.people.emplace(name, personCells(contentOf(entry.path(), view))).second)
+        else if (!view.people.emplace(name, personCells(name, contentOf(entry.path(), view), view.faults)).second)
             view.faults.push_back("the store has " + name + " twice");
     }
 }

@@ -308,7 +308,9 @@ void World::step(size_t number) {
 
 void World::clean(char role) {
     inProcess("clean daemon", role, [&](Report& report) {
+        constexpr double kAnHour = 3600; // what a store has refused rests for half an hour at most
         Weather calm;
+        if (_settling) calm.later = kAnHour;
         calm.ownTree = "/dav/" + person(role).account.user.str() + "/";
         Daemon daemon(person(role), calm, report);
         daemon.pass();
@@ -369,7 +371,9 @@ std::vector<std::string> World::compareAll() {
 }
 
 void World::settle() {
-    constexpr size_t kRounds = 3;
+    constexpr size_t kRounds =
+        4; // a circle of groups that a pass of the last one brings takes two looks of the owner's
+    _settling = true;
     tell("== all is well again");
     for (size_t round = 1; round <= kRounds; ++round) {
         for (const char role : {'o', 'w', 'r'}) clean(role);

@@ -73,6 +73,7 @@ private:
     Model _model;
     Outcome _outcome;
     std::vector<std::string> _wrong, _wrote; // what processes told
+    bool _settling = false;                  // all is well again
     int _log = -1;
 };
 
