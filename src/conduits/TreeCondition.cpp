@@ -153,17 +153,18 @@ Dictionary namesAlone(const Dictionary& prior, const Dictionary& current,
     for (const auto& [name, state] : current) {
         if (!isGroup(name) || name == kEverybody) continue;
         Array names;
-        const auto collect = [&](const char* list, const ListedNames& listed, const ListedNames& before,
+        const auto collect = [&](const Array& named, const ListedNames& listed, const ListedNames& before,
                                  const auto& isThere) {
-            for (const Value& each : state.dictionary()[list].array()) {
+            for (const Value& each : named) {
                 const UniqueId uid(each.string());
                 if (!listed.contains(uid) && !isThere(uid) && (before.contains(uid) || !isHere(uid)))
                     names.append(each);
             }
         };
-        collect(kMemberUIDState, people, peopleBefore, [&](const UniqueId& uid) { return files.contains(uid.str()); });
+        collect(state.dictionary()[kMemberUIDState].array(), people, peopleBefore,
+                [&](const UniqueId& uid) { return files.contains(uid.str()); });
         if (!groups.empty() || !groupsBefore.empty()) // else single groups are published, and the list names none
-            collect(kSubgroupUIDState, groups, groupsBefore,
+            collect(state.dictionary()[kSubgroupUIDState].array(), groups, groupsBefore,
                     [&](const UniqueId& uid) { return !current[uid.str()].dictionary().empty(); });
         if (!names.empty()) alone.set(name, names);
     }
