@@ -27,7 +27,7 @@ struct PrivateStoreOptions {
     int processes = 1; // at start; grows up to maximumProcesses
     int maximumProcesses = 4;
     int threadsPerProcess = 32;
-    int keepAliveSeconds = 60;
+    int keepAliveSeconds = 15;
     int maximumKeepAliveRequests = 0;            // 0 = no limit
     int passwordCost = 10;                       // of bcrypt (PasswordFile.h); not kept from one start to the next
     std::string logLevel = "warn";               // httpd's LogLevel

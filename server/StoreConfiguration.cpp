@@ -127,8 +127,9 @@ std::string renderStoreConfiguration(const std::string& templateText, const Priv
                        {"REALM", kStoreRealm},
                        {"LISTEN", "Listen 127.0.0.1:" + number + (withIPv6 ? "\nListen [::1]:" + number : "")},
                        {"PROCESSES", std::to_string(processes)},
-                       {"SERVER_LIMIT", std::to_string(limit)},
+                       {"SERVER_LIMIT", std::to_string(2 * limit)},
                        {"THREADS", std::to_string(threads)},
+                       {"SPARE_THREADS", std::to_string(std::max(threads / 2, 1))},
                        {"WORKERS", std::to_string(threads * limit)},
                        {"KEEPALIVE_TIMEOUT", std::to_string(std::max(options.keepAliveSeconds, 1))},
                        {"KEEPALIVE_REQUESTS", std::to_string(std::max(options.maximumKeepAliveRequests, 0))},
@@ -185,7 +186,10 @@ PrivateStoreOptions storeOptionsFromDictionary(const Dictionary& d) {
     readInteger("processes", options.processes);
     readInteger("maximumProcesses", options.maximumProcesses);
     readInteger("threadsPerProcess", options.threadsPerProcess);
+    // Earlier versions kept 60, which nobody had asked for.
+    const int longest = options.keepAliveSeconds; // seconds
     readInteger("keepAliveSeconds", options.keepAliveSeconds);
+    options.keepAliveSeconds = std::min(options.keepAliveSeconds, longest);
     readInteger("maximumKeepAliveRequests", options.maximumKeepAliveRequests);
     if (d.contains("logLevel")) options.logLevel = d["logLevel"].string();
     options.accessLog = d["accessLog"].boolean(options.accessLog);

@@ -16,6 +16,7 @@
 #include <poll.h>
 #include <pwd.h>
 #include <sys/prctl.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
@@ -54,9 +55,19 @@ bool becomeIdentity(const StoreIdentity& identity) {
     return keepCapability(inBoundingSet(CAP_DAC_READ_SEARCH) ? CAP_DAC_READ_SEARCH : CAP_DAC_OVERRIDE);
 }
 
+// A connection is a descriptor, and a session's usual limit is a thousand of them.
+void allowDescriptors() {
+    constexpr rlim_t kEnough = 16384;
+    rlimit limit{};
+    if (getrlimit(RLIMIT_NOFILE, &limit) != 0 || limit.rlim_cur >= kEnough) return;
+    limit.rlim_cur = std::min(limit.rlim_max, kEnough);
+    setrlimit(RLIMIT_NOFILE, &limit);
+}
+
 [[noreturn]] void runChild(char* const* arguments, const StoreIdentity& identity, int output, int report) {
     setsid();
     umask(0077);
+    allowDescriptors();
     sigset_t none;
     sigemptyset(&none);
     sigprocmask(SIG_SETMASK, &none, nullptr);

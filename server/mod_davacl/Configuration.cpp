@@ -104,6 +104,11 @@ const char* setStrict(cmd_parms* cmd, void*, int on) {
     return nullptr;
 }
 
+const char* setParks(cmd_parms* cmd, void*, int on) {
+    ofServer(cmd->server)->parks = on;
+    return nullptr;
+}
+
 // AP_INIT_* want the one type of function in a union that C++ will not convert to.
 template <class Function>
 cmd_func asCommand(Function function) {
@@ -144,6 +149,11 @@ const char* userFileOf(const request_rec* r) {
     return c ? c->userFile : nullptr;
 }
 
+bool parksConnections(const server_rec* server) {
+    const Configuration* c = ofServer(server);
+    return c && c->parks > 0;
+}
+
 void* createConfiguration(apr_pool_t* pool, server_rec*) {
     return new (apr_palloc(pool, sizeof(Configuration))) Configuration;
 }
@@ -161,6 +171,7 @@ void* mergeConfigurations(apr_pool_t* pool, void* base, void* more) {
     if (inner->users) merged->users = inner->users;
     if (inner->userFile) merged->userFile = inner->userFile;
     if (inner->strict >= 0) merged->strict = inner->strict;
+    if (inner->parks >= 0) merged->parks = inner->parks;
     if (inner->depth) merged->depth = inner->depth;
     if (inner->entries) merged->entries = inner->entries;
     return merged;
@@ -242,6 +253,8 @@ const command_rec kDirectives[] = {
      "a file with a line for each user, which begins with the name and a colon, such as AuthUserFile names"},
     {"DavAclStrict", asCommand(setStrict), nullptr, RSRC_CONF, FLAG,
      "whether a way around the lists that cannot be closed keeps httpd from starting: On by default"},
+    {"DavAclParkConnections", asCommand(setParks), nullptr, RSRC_CONF, FLAG,
+     "whether connections that say nothing wait without a thread: Off by default"},
     {"DavAclMaxEntries", asCommand(setMaxEntries), nullptr, RSRC_CONF, TAKE1,
      "how many entries a list may hold: 1000 by default"},
     {"DavAclDepth", asCommand(setDepth), nullptr, RSRC_CONF, TAKE1,

@@ -14,6 +14,7 @@ struct Configuration {
     const char* userFile = nullptr;      // null: none; who stands in it exists, and no provider is asked
     int entries = 0;                     // the most that a list holds
     int strict = -1;                     // whether a way around the lists keeps httpd from starting; -1: not said
+    int parks = -1;                      // whether silent connections wait without a thread; -1: not said
     int depth = 0;                       // how many segments below the base may have lists of their own
 
     bool isStrict() const { return strict != 0; }
@@ -27,6 +28,8 @@ const Configuration* configurationOf(const request_rec* r);
 
 // DavAclUserFile's argument, with or without a base; null when there is none.
 const char* userFileOf(const request_rec* r);
+// DavAclParkConnections, of the host that the connection came to.
+bool parksConnections(const server_rec* server);
 
 void* createConfiguration(apr_pool_t* pool, server_rec* server);
 void* mergeConfigurations(apr_pool_t* pool, void* base, void* more);

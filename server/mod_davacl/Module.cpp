@@ -6,8 +6,11 @@
 #include "server/mod_davacl/Confinement.h"
 #include "server/mod_davacl/Enforcement.h"
 #include "server/mod_davacl/LiveProperties.h"
+#include "server/mod_davacl/Parking.h"
 #include "server/mod_davacl/Passwords.h"
 #include "server/mod_davacl/PrincipalResources.h"
+
+#include <http_connection.h>
 
 namespace rolvane::davacl {
 namespace {
@@ -26,6 +29,7 @@ void registerHooks(apr_pool_t* pool) noexcept {
     ap_hook_post_config(checkConfigurations, nullptr, nullptr, APR_HOOK_MIDDLE);
     ap_hook_post_perdir_config(confine, nullptr, nullptr, APR_HOOK_MIDDLE);
     ap_hook_handler(serveConfined, nullptr, nullptr, APR_HOOK_REALLY_FIRST - 10);
+    ap_hook_process_connection(parkSilent, nullptr, nullptr, APR_HOOK_REALLY_FIRST);
     ap_hook_fixups(enforce, nullptr, nullptr, APR_HOOK_REALLY_FIRST);
     ap_hook_handler(servePrincipals, nullptr, beforeDav, APR_HOOK_FIRST);
     ap_hook_handler(serveAcl, nullptr, beforeDav, APR_HOOK_FIRST);
