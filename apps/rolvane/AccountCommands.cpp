@@ -7,6 +7,7 @@
 #include "foundation/Paths.h"
 #include "foundation/Preferences.h"
 #include "store/CXDAVManager.h"
+#include "store/StoreTrial.h"
 
 #include <filesystem>
 #include <fmt/format.h>
@@ -148,7 +149,40 @@ void showAccount(Context& context) {
     if (account->plainLoopback) context.line(fmt::format("{:<15}{}", "Transport", "plain http on this machine"));
 }
 
-// Signs in and looks whether the tree is there. Exit code 5 for a refused login, 6 for a store that is not reached.
+// What follows from what a store that can be used lacks.
+std::vector<std::string> consequences(const StoreTrial& trial) {
+    std::vector<std::string> lines;
+    if (!trial.locks && trial.conditions)
+        lines.emplace_back(
+            "It keeps no locks: of two who change one file at once the second is told, and tries again.");
+    if (!trial.locks && !trial.conditions)
+        lines.emplace_back(
+            "It keeps no locks and heeds no conditions: of two who change one file at once the later one "
+            "wins. Publish from one machine at a time.");
+    if (!trial.dates && trial.tags) lines.emplace_back("Its listings tell no dates: versions are told by their tags.");
+    if (trial.dates && !trial.tags)
+        lines.emplace_back("Its listings tell no tags: versions are told by date and size.");
+    if (!trial.dates && !trial.tags)
+        lines.emplace_back("Its listings tell neither dates nor tags: every pass reads everything.");
+    if (!trial.accessLists)
+        lines.emplace_back(
+            "It keeps no access lists: who may read is the store's own matter, and `rolvane share` cannot "
+            "change it.");
+    return lines;
+}
+
+Json trialJson(const StoreTrial& trial) {
+    return {{"usable", !trial.hindrance},
+            {"hindrance", trial.hindrance ? Json(trial.hindrance->what) : Json()},
+            {"dates", trial.dates},
+            {"tags", trial.tags},
+            {"locks", trial.locks},
+            {"conditions", trial.conditions},
+            {"accessLists", trial.accessLists}};
+}
+
+// Signs in, tries what a publication does, and looks whether the tree is there. Exit code 5 for a refused login or
+// step, 6 for a store that is not reached, 1 for one that cannot be used.
 void testAccount(Context& context) {
     const auto account = savedAccount();
     if (!account) throw CommandError(kNotFound, "There is no account on a store yet. `rolvane account set` makes one.");
@@ -157,13 +191,27 @@ void testAccount(Context& context) {
     const bool structure = !failure && CXDAVManager::defaultManager().sanityCheckPublishStructureCreate(false);
     const FailureScene scene = sceneOfTheAccount(Clock::system().now());
     const FailureText text = failure ? failureText(*failure, scene) : FailureText{kOk, {}, {}};
+    const StoreTrial trial = failure ? StoreTrial() : tryStore(CXDAVManager::defaultManager());
     if (context.json)
         context.print({{"reachable", !failure},
                        {"code", failure ? failure->error : 0},
                        {"reason", failure ? Json(text.what) : Json()},
                        {"failure", failure ? failureJson(*failure, scene) : Json()},
-                       {"published", structure}});
+                       {"published", structure},
+                       {"trial", failure ? Json() : trialJson(trial)}});
     if (failure) throw CommandError(text.code, text.what + " " + text.toDo);
+    if (trial.hindrance) {
+        const int status = trial.hindrance->status;
+        const char* toDo = status == 403 || status == 401
+                               ? "Have the store's administrator let you use your own tree."
+                               : "Check the account's endpoint: it has to be a WebDAV folder for files of every kind. "
+                                 "Servers for address books or calendars alone take none.";
+        throw CommandError(status == 403 || status == 401 ? kRefused
+                           : status == 0                  ? kUnreachable
+                                                          : kFailed,
+                           trial.hindrance->what + " Nothing can be published there. " + toDo);
+    }
+    for (const std::string& line : consequences(trial)) context.say(line);
     context.say(structure ? "The store can be used, and the account's tree is there."
                           : "The store can be used; the account has no tree there yet.");
 }
@@ -200,7 +248,8 @@ void addAccountCommands(CLI::App& app, Context& context) {
         nullptr);
     set->final_callback([&context, o, set] { setAccount(context, *set, *o); });
     addCommand(*account, context, "show", "Show the account", nullptr, [&context] { showAccount(context); });
-    addCommand(*account, context, "test", "Sign in to the store", nullptr, [&context] { testAccount(context); });
+    addCommand(*account, context, "test", "Sign in to the store and try all that a publication needs of it", nullptr,
+               [&context] { testAccount(context); });
 }
 
 } // namespace rolvane::cli

@@ -16,6 +16,7 @@ namespace rolvane {
 namespace {
 
 constexpr int64_t kBeliefMilliseconds = 30000;
+constexpr int64_t kHangMilliseconds = 600000; // that long the tree's OPTIONS are not waited for again
 constexpr HttpLimits kOptionsLimits{20, 10, 1u << 20, 64u << 10};
 
 int64_t steadyMilliseconds() {
@@ -271,7 +272,14 @@ std::vector<HttpResponse> StoreSession::optionsAndMore(std::vector<HttpRequest> 
     r.limits = kOptionsLimits;
     requests.insert(requests.begin(), std::move(r));
     const std::vector<HttpRequest> asked = requests;
+    const bool isKnownToHang = steadyMilliseconds() < _hangsUntil;
+    if (isKnownToHang) requests.erase(requests.begin());
     std::vector<HttpResponse> answers = _transport->performAll(std::move(requests));
+    if (isKnownToHang) {
+        HttpResponse none;
+        none.error = TransportError::timedOut;
+        answers.insert(answers.begin(), std::move(none));
+    }
     for (size_t i = 0; i < answers.size(); ++i) answers[i] = followed(asked[i], std::move(answers[i]));
     answers.front() = optionsAbove(std::move(answers.front()));
     if (!heedOptions(answers.front()) && answers.front().status != 401) _davSeen = 0;
@@ -292,7 +300,10 @@ bool StoreSession::heedOptions(const HttpResponse& answer) {
 // that is there is asked. The answer to go by.
 HttpResponse StoreSession::optionsAbove(HttpResponse ofTheTree) {
     const bool isRefused = verdictOn("OPTIONS", ofTheTree) == AnswerVerdict::refusal && !announcesDav(ofTheTree);
-    if (!isRefused && ofTheTree.error != TransportError::timedOut) return ofTheTree;
+    if (!isRefused && ofTheTree.error != TransportError::timedOut) {
+        _hangsUntil = 0;
+        return ofTheTree;
+    }
     Url above = *endpoint(_account.baseLocationFor(_account.user));
     while (above.pathComponents().size() > 1) {
         above = above.cxURLByDeletingLastComponent();
@@ -304,8 +315,11 @@ HttpResponse StoreSession::optionsAbove(HttpResponse ofTheTree) {
         HttpRequest asking = request("OPTIONS", namedAsCollection(above));
         asking.limits = kOptionsLimits;
         HttpResponse answer = performed(std::move(asking));
-        return verdictOn("OPTIONS", answer) == AnswerVerdict::success ? answer : ofTheTree;
+        if (verdictOn("OPTIONS", answer) != AnswerVerdict::success) break;
+        if (!isRefused && steadyMilliseconds() >= _hangsUntil) _hangsUntil = steadyMilliseconds() + kHangMilliseconds;
+        return answer;
     }
+    _hangsUntil = 0;
     return ofTheTree;
 }
 

@@ -102,7 +102,8 @@ private:
     std::atomic<bool> _signedIn{false};
     std::atomic<bool> _membersTags{false};
     std::atomic<bool> _mayKeepLocks{true};
-    std::atomic<int> _accessLists{-1}; // 1 or 0 as the server announced it last, -1: it never answered
+    std::atomic<int> _accessLists{-1};   // 1 or 0 as the server announced it last, -1: it never answered
+    std::atomic<int64_t> _hangsUntil{0}; // steady milliseconds: OPTIONS of the tree were not answered, those above were
     std::atomic<int64_t> _davSeen{0}; // steady milliseconds when the server last proved to be a WebDAV server; 0: never
 };
 

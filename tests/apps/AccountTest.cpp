@@ -62,6 +62,9 @@ TEST_F(Account, AWorkingOneIsReachable) {
     EXPECT_EQ(result["reachable"], true);
     EXPECT_EQ(result["published"], false);
     EXPECT_TRUE(result["reason"].is_null());
+    for (const char* able : {"usable", "dates", "tags", "locks", "conditions", "accessLists"})
+        EXPECT_EQ(result["trial"][able], true) << able;
+    EXPECT_TRUE(world.tree().empty()) << "the trial leaves nothing";
 }
 
 TEST_F(Account, AWrongPasswordIsNotAllowed) {

@@ -3,6 +3,7 @@
 #include "StoreWorld.h"
 #include "store/CXWebDAVLock.h"
 #include "store/StoreLock.h"
+#include "store/StoreTrial.h"
 #include "support/OddServer.h"
 
 #include <functional>
@@ -216,6 +217,9 @@ TEST(OddServer, ThatHangsOnOptionsOfAMissingTreeIsAskedAbove) {
     CXDAVError error;
     EXPECT_TRUE(alice.manager->canReach(error)) << error.reason;
     EXPECT_TRUE(alice.manager->sanityCheckPublishStructureCreate(true)) << alice.wire->text();
+    size_t hung = 0;
+    for (const auto& e : alice.wire->exchanges()) hung += e.method == "OPTIONS" && e.status == 0;
+    EXPECT_EQ(hung, 1u) << "it is waited for once";
 }
 
 TEST(OddServer, ThatIsNoWebDAVServerIsNotAskedWithoutEnd) {
@@ -246,6 +250,60 @@ TEST(OddServer, WhoCouldNotDeleteAllIsNotBelievedToHaveDoneSo) {
         int code = 0;
         EXPECT_FALSE(alice.manager->removeFileAtURL(alice.at("dateFile"), &code));
         EXPECT_EQ(code, 207);
+    }
+}
+
+// What a trial finds of a server, and that it leaves nothing behind.
+StoreTrial trialOf(const Oddities& habits, bool isPublished = false) {
+    OddServer server(habits);
+    OddClient alice(server);
+    if (isPublished) EXPECT_TRUE(alice.manager->sanityCheckPublishStructureCreate(true));
+    const auto files = server.files();
+    const auto collections = server.collections();
+    CXDAVError error;
+    EXPECT_TRUE(alice.manager->canReach(error)) << error.reason;
+    const StoreTrial trial = tryStore(*alice.manager);
+    EXPECT_EQ(server.files(), files) << alice.wire->text();
+    EXPECT_EQ(server.collections(), collections) << alice.wire->text();
+    EXPECT_TRUE(server.locked().empty());
+    return trial;
+}
+
+TEST(StoreTrials, FindWhatAServerDoesAndLeaveNothing) {
+    for (const bool isPublished : {false, true}) {
+        const StoreTrial all = trialOf({}, isPublished);
+        EXPECT_FALSE(all.hindrance) << all.hindrance->what;
+        EXPECT_TRUE(all.dates && all.tags && all.locks && all.conditions);
+        EXPECT_FALSE(all.accessLists);
+    }
+    Oddities odd;
+    odd.dates = false;
+    odd.davHeaders = "DAV: 1, access-control\r\n";
+    const StoreTrial some = trialOf(odd);
+    EXPECT_FALSE(some.hindrance);
+    EXPECT_FALSE(some.dates);
+    EXPECT_FALSE(some.locks) << "class 2 is not announced";
+    EXPECT_TRUE(some.tags && some.conditions && some.accessLists);
+}
+
+TEST(StoreTrials, SayWhatCannotWork) {
+    for (const int status : {403, 405, 501, 507}) {
+        Oddities odd;
+        odd.mkcol = status;
+        const StoreTrial trial = trialOf(odd);
+        ASSERT_TRUE(trial.hindrance) << status;
+        EXPECT_EQ(trial.hindrance->status, status);
+        EXPECT_NE(trial.hindrance->what.find("makes no folders (MKCOL was answered with " + std::to_string(status)),
+                  std::string::npos)
+            << trial.hindrance->what;
+    }
+    for (const int status : {400, 403, 409, 415}) { // as servers for address books alone do
+        Oddities odd;
+        odd.put = status;
+        const StoreTrial trial = trialOf(odd);
+        ASSERT_TRUE(trial.hindrance) << status;
+        EXPECT_EQ(trial.hindrance->status, status);
+        EXPECT_NE(trial.hindrance->what.find("takes no files of this kind"), std::string::npos);
     }
 }
 
