@@ -150,8 +150,7 @@ private:
 } // namespace
 
 StoreTrial tryStore(CXDAVManager& store) {
-    const auto client = store.impl();
-    return Trial(*client).run();
+    return Trial(*store.impl()).run();
 }
 
 } // namespace rolvane

@@ -104,12 +104,16 @@ class Server:
         end = time.monotonic() + 20
         while True:
             try:
-                socket.create_connection(("127.0.0.1", self.port), 1).close()
+                self.listening()
                 return
             except OSError:
                 if time.monotonic() > end or any(p.poll() is not None for p in self.processes):
                     raise RuntimeError(f"{self.name} did not start: {self.words()}") from None
                 time.sleep(0.05)
+
+    def listening(self):
+        """An OSError while the server does not listen yet."""
+        socket.create_connection(("127.0.0.1", self.port), 1).close()
 
     def words(self):
         with open(os.path.join(self.directory, "log"), errors="replace") as log:
@@ -312,6 +316,10 @@ class Behind(Nginx):
         super().__init__(directory, authority)
         self.inner = free_port()
 
+    def listening(self):
+        super().listening()
+        socket.create_connection(("127.0.0.1", self.inner), 1).close()
+
     def location(self):
         return f"""
             location / {{
@@ -325,6 +333,10 @@ class Sabre(Behind):
     name = "PHP (php-sabre-dav by php-fpm, behind nginx)"
     packages = ("php-sabre-dav", "php8.2-fpm", "nginx")
     files = ("/usr/sbin/nginx", "/usr/share/php/Sabre/DAV/Server.php", "/usr/sbin/php-fpm*")
+
+    def listening(self):
+        Nginx.listening(self)
+        os.stat(os.path.join(self.directory, "run/php.sock"))
 
     def location(self):
         return f"""
