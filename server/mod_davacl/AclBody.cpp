@@ -74,7 +74,8 @@ std::optional<Unmet> readPrivileges(const apr_xml_elem* grant, Grant& into) {
 bool isWellFormed(const apr_xml_elem* ace) {
     const size_t principals = countOf(ace, "principal") + countOf(ace, "invert");
     const apr_xml_elem* principal = child(child(ace, "invert") ? child(ace, "invert") : ace, "principal");
-    if (principals != 1 || elementsIn(principal) != 1 || countOf(ace, "grant") + countOf(ace, "deny") != 1)
+    if (principals != 1 || elementsIn(principal) != 1 || !textOf(principal).empty() ||
+        countOf(ace, "grant") + countOf(ace, "deny") != 1)
         return false;
     const apr_xml_elem* property = child(principal, "property");
     return !property || elementsIn(property) == 1;

@@ -59,7 +59,9 @@ bool XmlSax::feed(std::string_view bytes) {
 
 bool XmlSax::finish() {
     if (_good && xmlParseChunk(_context, nullptr, 0, 1) != 0) _good = false;
-    return _good && _context->wellFormed == 1;
+    // WebDAV's XML has to be well formed with its namespaces, too (RFC 4918 section 17): a name whose prefix nobody
+    // declared belongs nowhere.
+    return _good && _context->wellFormed == 1 && _context->nsWellFormed == 1;
 }
 
 void XmlSax::refuse() {
