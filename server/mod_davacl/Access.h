@@ -30,6 +30,7 @@ struct RequestState {
         entries; // of DAV:acl, by list and where it is shown from
     std::optional<std::set<std::string, std::less<>>> usersInFile;
     std::map<std::string, bool, std::less<>> knownUsers; // as the providers said
+    std::optional<std::string> groupText;                // of the group file
     std::optional<Missing> destinationLacks;             // why the sub-request for a Destination was refused
     std::vector<ListStore::Guard> guards;
     std::map<const ap_conf_vector_t*, ap_conf_vector_t*> confined; // the sections' settings, and with ours on top

@@ -47,10 +47,11 @@ bool mayOnEveryTree(request_rec* r, const Configuration& c, unsigned needed) {
            });
 }
 
-// Infinity is what LOCK, COPY, MOVE and PROPFIND mean when they say nothing.
+// Infinity is what LOCK, COPY, MOVE and PROPFIND mean when they say nothing; REPORT means 0 (RFC 3253 section 3.6).
 bool isDeep(const request_rec* r) {
     const char* depth = apr_table_get(r->headers_in, "Depth");
-    return !depth || (std::strcmp(depth, "0") != 0 && std::strcmp(depth, "1") != 0);
+    if (!depth) return std::strcmp(r->method, "REPORT") != 0;
+    return (std::strcmp(depth, "0") != 0 && std::strcmp(depth, "1") != 0);
 }
 
 // A request may take in all trees without naming one of them.

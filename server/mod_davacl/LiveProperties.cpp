@@ -3,6 +3,7 @@
 #include "server/mod_davacl/Access.h"
 #include "server/mod_davacl/MembersTag.h"
 #include "server/mod_davacl/PrincipalResources.h"
+#include "server/mod_davacl/Reports.h"
 
 #include <string_view>
 
@@ -18,6 +19,7 @@ enum Property {
     kInheritedAclSet,
     kPrincipalCollectionSet,
     kCurrentUserPrincipal,
+    kSupportedReportSet,
     kMembersTag
 };
 const char* const kNamespaces[] = {"DAV:", kOwnNamespace, nullptr};
@@ -30,6 +32,7 @@ const dav_liveprop_spec kProperties[] = {{0, "owner", kOwner, 0},
                                          {0, "inherited-acl-set", kInheritedAclSet, 0},
                                          {0, "principal-collection-set", kPrincipalCollectionSet, 0},
                                          {0, "current-user-principal", kCurrentUserPrincipal, 0},
+                                         {0, "supported-report-set", kSupportedReportSet, 0},
                                          {kOwn, kMembersTagName, kMembersTag, 0},
                                          {0, nullptr, 0, 0}};
 
@@ -138,6 +141,7 @@ std::optional<std::string> valueOf(const Asked& a, int property) {
         return text;
     }
     case kPrincipalCollectionSet: return principalCollections(a.r, a.c);
+    case kSupportedReportSet: return supportedReports(true);
     case kCurrentUserPrincipal: return currentUserPrincipal(a.r, a.c);
     default: return std::nullopt;
     }
@@ -213,6 +217,18 @@ dav_error* addToMethods(request_rec* r, const dav_resource*, apr_text_header* te
 
 const dav_liveprop_group kLiveProperties = {kProperties, kNamespaces, &kHooks};
 const dav_options_provider kOptions = {addToHeader, addToMethods, nullptr};
+
+std::optional<std::string> livePropertyElement(const dav_resource* resource, std::string_view name) {
+    for (const dav_liveprop_spec* spec = kProperties; spec->name; ++spec) {
+        if (spec->ns == kOwn || name != spec->name) continue;
+        apr_text_header text{};
+        if (insertProperty(resource, spec->propid, DAV_PROP_INSERT_VALUE, &text) != DAV_PROP_INSERT_VALUE) break;
+        std::string all;
+        for (const apr_text* piece = text.first; piece; piece = piece->next) all += piece->text;
+        return all;
+    }
+    return std::nullopt;
+}
 
 int findLiveProperty(const dav_resource* resource, const char* space, const char* name,
                      const dav_hooks_liveprop** hooks) noexcept {

@@ -2,6 +2,10 @@
 
 #include "server/mod_davacl/Httpd.h"
 
+#include <optional>
+#include <string>
+#include <string_view>
+
 namespace rolvane::davacl {
 
 // A property of our own: of a collection of files, its MembersTag. It is announced in the DAV header (RFC 4918 section
@@ -16,6 +20,10 @@ int findLiveProperty(const dav_resource* resource, const char* space, const char
                      const dav_hooks_liveprop** hooks) noexcept;
 void insertAllLiveProperties(request_rec* r, const dav_resource* resource, dav_prop_insert what,
                              apr_text_header* text) noexcept;
+
+// The element of a property of RFC 3744 in DAV:, with its content; nothing when it is none of ours, not defined there
+// or not for this user.
+std::optional<std::string> livePropertyElement(const dav_resource* resource, std::string_view name);
 
 // OPTIONS: "access-control" and the class above in the DAV header, ACL among the methods.
 extern const dav_options_provider kOptions;

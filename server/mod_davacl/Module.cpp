@@ -9,6 +9,7 @@
 #include "server/mod_davacl/Parking.h"
 #include "server/mod_davacl/Passwords.h"
 #include "server/mod_davacl/PrincipalResources.h"
+#include "server/mod_davacl/Reports.h"
 
 #include <http_connection.h>
 
@@ -37,6 +38,7 @@ void registerHooks(apr_pool_t* pool) noexcept {
     dav_hook_method_precondition(enforceOnMember, nullptr, nullptr, APR_HOOK_MIDDLE);
     dav_hook_find_liveprop(findLiveProperty, nullptr, nullptr, APR_HOOK_MIDDLE);
     dav_hook_insert_all_liveprops(insertAllLiveProperties, nullptr, nullptr, APR_HOOK_MIDDLE);
+    dav_hook_deliver_report(reportOnTrees, nullptr, nullptr, APR_HOOK_MIDDLE);
     dav_hook_gather_propsets(gatherPropertySets, nullptr, nullptr, APR_HOOK_MIDDLE);
     dav_register_liveprop_group(pool, &kLiveProperties);
     dav_options_provider_register(pool, "davacl", const_cast<dav_options_provider*>(&kOptions));

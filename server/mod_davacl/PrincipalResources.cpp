@@ -1,6 +1,7 @@
 #include "server/mod_davacl/PrincipalResources.h"
 
 #include "server/mod_davacl/GroupFile.h"
+#include "server/mod_davacl/Reports.h"
 
 #include <cstring>
 #include <set>
@@ -67,14 +68,17 @@ std::string pathOf(const Configuration& c, const Place& place) {
                                                          : groupPath(c, place.principal.name);
 }
 
-std::string groupText(const Configuration& c) {
-    return c.groupFile ? fileText(c.groupFile) : std::string();
+// Read once a request.
+const std::string& groupText(request_rec* r, const Configuration& c) {
+    auto& text = stateOf(r).groupText;
+    if (!text) text = c.groupFile ? fileText(c.groupFile) : std::string();
+    return *text;
 }
 
 // Who is in a group, or which groups somebody is in. Shown to whom it concerns.
 std::optional<std::string> membersOf(request_rec* r, const Configuration& c, const Principal& principal) {
     if (principal.kind != Principal::Kind::group) return std::nullopt;
-    const auto users = usersIn(principal.name, groupText(c));
+    const auto users = usersIn(principal.name, groupText(r, c));
     if (!users.contains(r->user)) return std::nullopt;
     std::string text;
     for (const std::string& user : users) text += hrefElement(r, userPath(c, user));
@@ -85,7 +89,8 @@ std::optional<std::string> membershipOf(request_rec* r, const Configuration& c, 
     if (principal.kind == Principal::Kind::group) return std::string();
     if (principal.name != r->user) return std::nullopt;
     std::string text;
-    for (const std::string& group : groupsOf(principal.name, groupText(c))) text += hrefElement(r, groupPath(c, group));
+    for (const std::string& group : groupsOf(principal.name, groupText(r, c)))
+        text += hrefElement(r, groupPath(c, group));
     return text;
 }
 
@@ -99,14 +104,33 @@ constexpr const char* kProperties[] = {"resourcetype",
                                        "current-user-principal",
                                        "current-user-privilege-set",
                                        "supported-privilege-set",
-                                       "acl-restrictions"};
+                                       "acl-restrictions",
+                                       "owner",
+                                       "acl",
+                                       "inherited-acl-set",
+                                       "supported-report-set"};
+
+// DAV:self (RFC 3744 section 5.5.1): the principal is the user, or a group of theirs.
+bool isSelf(request_rec* r, const Configuration& c, const Principal& principal) {
+    if (principal.kind == Principal::Kind::user) return principal.name == r->user;
+    return groupsOf(r->user, groupText(r, c)).contains(principal.name);
+}
+
+// Nobody can change it: principals are what the administrator's files say.
+constexpr const char* kAclOfPrincipals =
+    "<D:ace><D:principal><D:authenticated/></D:principal><D:grant><D:privilege><D:read/></D:privilege></D:grant>"
+    "<D:protected/></D:ace><D:ace><D:principal><D:self/></D:principal><D:grant><D:privilege><D:read-acl/>"
+    "</D:privilege></D:grant><D:protected/></D:ace>";
 
 std::optional<std::string> valueOf(request_rec* r, const Configuration& c, const Place& place, std::string_view name) {
     const bool isPrincipal = place.kind == Place::Kind::principal;
+    const bool self = isPrincipal && isSelf(r, c, place.principal);
     if (name == "resourcetype") return isPrincipal ? "<D:principal/>" : "<D:collection/>";
     if (name == "principal-collection-set") return principalCollections(r, c);
     if (name == "current-user-principal") return currentUserPrincipal(r, c);
-    if (name == "current-user-privilege-set") return privilegeElements(kReading);
+    if (name == "current-user-privilege-set") return privilegeElements(kReading | (self ? kReadAcl : 0));
+    if (name == "supported-report-set") return supportedReports(false);
+    if (name == "inherited-acl-set") return std::string();
     if (name == "supported-privilege-set") return supportedPrivileges();
     if (name == "acl-restrictions") return "<D:no-invert/>";
     if (!isPrincipal) return std::nullopt;
@@ -115,12 +139,10 @@ std::optional<std::string> valueOf(request_rec* r, const Configuration& c, const
     if (name == "alternate-URI-set") return std::string();
     if (name == "group-member-set") return membersOf(r, c, place.principal);
     if (name == "group-membership") return membershipOf(r, c, place.principal);
+    if (name == "owner") return place.principal.kind == Principal::Kind::user ? hrefElement(r, pathOf(c, place)) : "";
+    if (name == "acl" && self) return kAclOfPrincipals;
     return std::nullopt;
 }
-
-struct Wanted {
-    std::string space, name;
-};
 
 // What the body asks for. False when it is no DAV:propfind.
 bool readBody(const apr_xml_doc* doc, std::vector<Wanted>& wanted, bool& namesOnly) {
@@ -148,16 +170,6 @@ bool readBody(const apr_xml_doc* doc, std::vector<Wanted>& wanted, bool& namesOn
     return true;
 }
 
-std::string emptyElement(request_rec* r, const Wanted& property) {
-    if (property.space == "DAV:") return "<D:" + property.name + "/>";
-    return "<" + property.name + " xmlns=\"" + apr_xml_quote_string(r->pool, property.space.c_str(), 1) + "\"/>";
-}
-
-std::string propstat(const std::string& properties, const char* status) {
-    return "<D:propstat>\n<D:prop>" + properties + "</D:prop>\n<D:status>HTTP/1.1 " + status +
-           "</D:status>\n</D:propstat>\n";
-}
-
 std::string responseFor(request_rec* r, const Configuration& c, const Place& place, const std::vector<Wanted>& wanted,
                         bool namesOnly) {
     std::string found, missing;
@@ -181,7 +193,7 @@ std::vector<Place> membersOf(request_rec* r, const Configuration& c, const Place
     if (place.kind == Place::Kind::root) members = {{Place::Kind::users, {}}, {Place::Kind::groups, {}}};
     if (place.kind == Place::Kind::users) members = {{Place::Kind::principal, {Principal::Kind::user, r->user}}};
     if (place.kind == Place::Kind::groups)
-        for (const std::string& group : groupsOf(r->user, groupText(c)))
+        for (const std::string& group : groupsOf(r->user, groupText(r, c)))
             members.push_back({Place::Kind::principal, {Principal::Kind::group, group}});
     return members;
 }
@@ -211,6 +223,42 @@ int propfind(request_rec* r, const Configuration& c, const Place& place) {
     return OK;
 }
 
+std::string quoted(request_rec* r, const std::string& text) {
+    return apr_xml_quote_string(r->pool, text.c_str(), 1);
+}
+
+std::string link(request_rec* r, const Configuration& c, const Place& place) {
+    const std::string path = pathOf(c, place);
+    const std::string name = place.kind == Place::Kind::principal ? place.principal.name : path;
+    return "<li><a href=\"" + quoted(r, ap_os_escape_path(r->pool, path.c_str(), 1)) + "\">" + quoted(r, name) +
+           "</a></li>\n";
+}
+
+// For whoever opens the address in a browser: what PROPFIND tells, as a page.
+int page(request_rec* r, const Configuration& c, const Place& place) {
+    const bool isPrincipal = place.kind == Place::Kind::principal;
+    const bool isUser = place.principal.kind == Principal::Kind::user;
+    const std::string title = !isPrincipal ? "Principals" : (isUser ? "User " : "Group ") + place.principal.name;
+    std::string text = "<!DOCTYPE html>\n<html lang=\"en\"><head><meta charset=\"utf-8\"><title>" + quoted(r, title) +
+                       "</title></head>\n<body><h1>" + quoted(r, title) + "</h1>\n<ul>\n";
+    for (const Place& member : membersOf(r, c, place)) text += link(r, c, member);
+    if (isPrincipal && isSelf(r, c, place.principal)) {
+        const std::string& groups = groupText(r, c);
+        for (const std::string& name :
+             isUser ? groupsOf(place.principal.name, groups) : usersIn(place.principal.name, groups))
+            text +=
+                link(r, c, {Place::Kind::principal, {isUser ? Principal::Kind::group : Principal::Kind::user, name}});
+    }
+    text += "</ul></body></html>\n";
+    ap_set_content_type(r, "text/html; charset=utf-8");
+    apr_table_setn(r->headers_out, "Content-Security-Policy", "default-src 'none'");
+    apr_table_setn(r->headers_out, "X-Content-Type-Options", "nosniff");
+    apr_table_setn(r->headers_out, "Cache-Control", "private, no-cache");
+    ap_set_content_length(r, static_cast<apr_off_t>(text.size()));
+    if (!r->header_only) ap_rwrite(text.data(), static_cast<int>(text.size()), r);
+    return OK;
+}
+
 int serve(request_rec* r) {
     const Configuration* c = configurationOf(r);
     if (!c || !TreePath::of(c->principalBase(), r->uri)) return DECLINED;
@@ -222,12 +270,14 @@ int serve(request_rec* r) {
     const auto place = placeAt(*c, r->uri);
     if (!place || (place->kind == Place::Kind::principal && !exists(r, *c, place->principal))) return HTTP_NOT_FOUND;
     apr_table_setn(r->headers_out, "DAV", "1, access-control");
-    apr_table_setn(r->headers_out, "Allow", "OPTIONS, PROPFIND");
+    apr_table_setn(r->headers_out, "Allow", "OPTIONS, GET, HEAD, PROPFIND, REPORT");
     if (std::strcmp(r->method, "OPTIONS") == 0) {
         ap_set_content_length(r, 0);
         return OK;
     }
     if (std::strcmp(r->method, "PROPFIND") == 0) return propfind(r, *c, *place);
+    if (r->method_number == M_GET) return page(r, *c, *place); // HEAD, too
+    if (std::strcmp(r->method, "REPORT") == 0) return reportOnPrincipals(r, *c);
     return HTTP_METHOD_NOT_ALLOWED;
 }
 
@@ -235,6 +285,35 @@ int serve(request_rec* r) {
 
 int servePrincipals(request_rec* r) noexcept {
     return contained(r, static_cast<int>(HTTP_INTERNAL_SERVER_ERROR), [r] { return serve(r); });
+}
+
+std::string emptyElement(request_rec* r, const Wanted& property) {
+    if (property.space == "DAV:") return "<D:" + property.name + "/>";
+    return "<" + property.name + " xmlns=\"" + apr_xml_quote_string(r->pool, property.space.c_str(), 1) + "\"/>";
+}
+
+std::string propstat(const std::string& properties, const char* status) {
+    return "<D:propstat>\n<D:prop>" + properties + "</D:prop>\n<D:status>HTTP/1.1 " + status +
+           "</D:status>\n</D:propstat>\n";
+}
+
+std::string principalResponse(request_rec* r, const Configuration& c, const Principal& principal,
+                              const std::vector<Wanted>& wanted) {
+    const Place place{Place::Kind::principal, principal};
+    if (exists(r, c, principal)) return responseFor(r, c, place, wanted, false);
+    return "<D:response>\n" + hrefElement(r, pathOf(c, place)) +
+           "\n<D:status>HTTP/1.1 404 Not Found</D:status>\n</D:response>\n";
+}
+
+std::optional<std::string> principalValue(request_rec* r, const Configuration& c, const Principal& principal,
+                                          std::string_view name) {
+    return valueOf(r, c, {Place::Kind::principal, principal}, name);
+}
+
+std::vector<Principal> ownPrincipals(request_rec* r, const Configuration& c) {
+    std::vector<Principal> own = {{Principal::Kind::user, r->user}};
+    for (const std::string& group : groupsOf(r->user, groupText(r, c))) own.push_back({Principal::Kind::group, group});
+    return own;
 }
 
 std::string userPath(const Configuration& c, const std::string& user) {
@@ -266,7 +345,7 @@ std::string currentUserPrincipal(request_rec* r, const Configuration& c) {
 
 bool exists(request_rec* r, const Configuration& c, const Principal& principal) {
     if (principal.name.empty()) return true;
-    if (principal.kind == Principal::Kind::group) return groupsIn(groupText(c)).contains(principal.name);
+    if (principal.kind == Principal::Kind::group) return groupsIn(groupText(r, c)).contains(principal.name);
     if ((!c.users && !c.userFile) || principal.name == r->user) return true;
     if (c.userFile && usersInFile(r, c).contains(principal.name)) return true;
     if (!c.users) return false;
