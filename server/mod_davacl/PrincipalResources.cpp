@@ -128,7 +128,7 @@ std::optional<std::string> valueOf(request_rec* r, const Configuration& c, const
     if (name == "resourcetype") return isPrincipal ? "<D:principal/>" : "<D:collection/>";
     if (name == "principal-collection-set") return principalCollections(r, c);
     if (name == "current-user-principal") return currentUserPrincipal(r, c);
-    if (name == "current-user-privilege-set") return privilegeElements(kReading | (self ? kReadAcl : 0));
+    if (name == "current-user-privilege-set") return privilegeElements(self ? kReading | kReadAcl : kReading);
     if (name == "supported-report-set") return supportedReports(false);
     if (name == "inherited-acl-set") return std::string();
     if (name == "supported-privilege-set") return supportedPrivileges();

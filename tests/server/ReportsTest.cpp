@@ -228,7 +228,7 @@ TEST(ReportsSanitized, AreAnsweredWithoutAFault) {
     for (const char* path :
          {"/dav/", "/dav/alice/", "/dav/alice/Contacts/dateFile", "/principals/", "/principals/users/alice"})
         for (const char* name : kEvery)
-            for (const std::string content :
+            for (const std::string& content :
                  {std::string(), std::string("<D:self/><D:prop><D:displayname/><x xmlns=\"urn:y\"/></D:prop>"),
                   std::string("<D:principal-property><D:owner/></D:principal-property><D:prop><D:getetag/></D:prop>"),
                   std::string("<D:property-search><D:prop><D:displayname/></D:prop><D:match>rita</D:match>"
