@@ -25,6 +25,9 @@ using Steady = steady_clock;
 
 constexpr double kStillSeconds = 0.2; // without a byte, of an answer that has begun
 constexpr double kNudgeDeadline = 10;
+// Without a request, after which every connection is closed: a store of a thousand daemons holds no place for those at
+// rest, and none of them comes back to a connection that has died meanwhile.
+constexpr double kRestSeconds = 3;
 
 steady_clock::duration inSeconds(double s) {
     return duration_cast<steady_clock::duration>(duration<double>(s));
@@ -44,6 +47,7 @@ struct CurlTransport::Impl {
     void makeMulti();
     void run();
     void renewConnections();
+    void closeAtRest();
     void wait();
     void takeInbox();
     void dropAborted();
@@ -83,6 +87,7 @@ struct CurlTransport::Impl {
     KeptConnections kept;
     SteadyTime notBefore{}; // Retry-After
     std::optional<SteadyTime> curlTimer;
+    std::optional<SteadyTime> closing; // when nothing comes until then; none: no connection stands
     SteadyTime nextCheck{};
     SteadyTime nextNudge{};
     double secondsToNudge = kStillSeconds;
@@ -187,9 +192,15 @@ void CurlTransport::Impl::renewConnections() {
     const SteadyTime now = Steady::now();
     for (const CurlSlot* slot : active) kept.foundDead(slot->job()->origin, now);
     if (!active.empty()) return;
+    closing.reset();
     curl_multi_cleanup(multi);
     curlTimer.reset();
     makeMulti();
+}
+
+void CurlTransport::Impl::closeAtRest() {
+    if (!active.empty() || !pending.empty()) closing = Steady::now() + inSeconds(kRestSeconds);
+    if (closing && *closing <= Steady::now()) connectionsAreStale = true;
 }
 
 void CurlTransport::Impl::run() {
@@ -197,6 +208,7 @@ void CurlTransport::Impl::run() {
         takeInbox();
         dropAborted();
         if (!pending.empty() && kept.hasSlept()) connectionsAreStale = true;
+        closeAtRest();
         renewConnections();
         admit();
         wait();
@@ -228,6 +240,7 @@ void CurlTransport::Impl::wait() {
     };
     if (curlTimer) until(*curlTimer);
     if (!active.empty() || !pending.empty()) until(nextCheck);
+    if (closing) until(*closing);
     if (!pending.empty() && notBefore > Steady::now()) until(notBefore);
     epoll_event events[32];
     const int n = epoll_wait(epoll, events, 32, timeout);

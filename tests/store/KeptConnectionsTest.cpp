@@ -169,6 +169,35 @@ TEST(KeptConnections, AreGivenUpWhenTheNetworkChanges) {
     }
 }
 
+// A server would hold a thousand of them for a thousand programs at rest.
+TEST(KeptConnections, AreClosedSoonAfterTheLastRequest) {
+    const int listener = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    sockaddr_in address{};
+    address.sin_family = AF_INET;
+    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    socklen_t size = sizeof address;
+    ASSERT_EQ(bind(listener, reinterpret_cast<sockaddr*>(&address), size), 0);
+    ASSERT_EQ(listen(listener, 1), 0);
+    ASSERT_EQ(getsockname(listener, reinterpret_cast<sockaddr*>(&address), &size), 0);
+    CurlTransport transport{CurlTransportOptions()};
+    bool closed = false;
+    std::thread server([&] {
+        const int peer = accept(listener, nullptr, nullptr);
+        const timeval patience{20, 0}; // seconds; a connection that stays is used for half a minute
+        setsockopt(peer, SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
+        char part[4096];
+        const std::string answer = "HTTP/1.1 200 OK\r\nContent-Length: 0\r\n\r\n";
+        if (recv(peer, part, sizeof part, 0) > 0 && send(peer, answer.data(), answer.size(), MSG_NOSIGNAL) > 0)
+            closed = recv(peer, part, sizeof part, 0) == 0;
+        close(peer);
+    });
+    const std::string origin = "http://127.0.0.1:" + std::to_string(ntohs(address.sin_port));
+    EXPECT_EQ(transport.perform(asking(origin, "GET")).status, 200);
+    server.join();
+    close(listener);
+    EXPECT_TRUE(closed);
+}
+
 TEST(KeptConnections, AreGivenUpAfterTheMachineSlept) {
     std::atomic<double> asleep{4000};
     FakeHttpServer server([](const FakeRequest&) { return FakeAnswer::status(200); });
