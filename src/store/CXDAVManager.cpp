@@ -91,9 +91,7 @@ CXDAVManager::CXDAVManager(CXDAVAccount account, std::shared_ptr<HttpTransport> 
 CXDAVManager::CXDAVManager(CXDAVAccount account, std::shared_ptr<HttpTransport> transport, VersionsFile versions)
     : _impl(std::make_shared<Impl>(std::move(account), std::move(transport), nullptr, std::move(versions.path))) {}
 
-CXDAVManager::~CXDAVManager() {
-    _impl->versions.save();
-}
+CXDAVManager::~CXDAVManager() = default;
 
 const CXDAVAccount& CXDAVManager::account() const {
     return _impl->session.account();

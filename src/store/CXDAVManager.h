@@ -149,8 +149,8 @@ public:
     virtual bool setACLsWithReadPrincipals(const std::vector<std::string>& readers,
                                            const std::vector<std::string>& writers, const Url& url);
 
-    // Writes down which versions of files are known, so that the next run need not read them again. Losing it costs
-    // reads only. Also done when the client ends.
+    // Writes down which versions of files are known, so that the next run need not read them again: when the database
+    // has what was read. A client that ends does not, as its last pass may have failed. Losing it costs reads only.
     void saveVersionMemory();
     // The next listing gives the file as one that was not seen yet, so that it is read once more.
     void forgetVersion(const Url& url);

@@ -1,4 +1,5 @@
 #include "StoreWorld.h"
+#include "support/TempHome.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -299,6 +300,27 @@ TEST_F(Publishing, TwentyThreadsWriteAtOnceOverFewConnections) {
         });
     for (auto& t : threads) t.join();
     EXPECT_EQ(good, 200);
+}
+
+// A pass that could not be saved has read what its database does not have.
+TEST(VersionsOfFiles, AreKnownToTheNextRunWhenTheyWereSavedAndNotBecauseTheClientEnds) {
+    StoreWorld world;
+    Client alice(world);
+    ASSERT_TRUE(alice.manager.sanityCheckPublishStructureCreate(true));
+    ASSERT_EQ(alice.write("Friends", Dictionary{{"name", "Friends"}}), 201);
+    const TempDirectory directory;
+    const auto run = [&] {
+        return std::make_unique<CXDAVManager>(world.account("alice"), alice.wire,
+                                              CXDAVManager::VersionsFile{directory / "versions"});
+    };
+    for (const bool isSaved : {false, true}) {
+        auto client = run();
+        EXPECT_TRUE(client->dictionaryAtURL(alice.at("Friends"), nullptr, false));
+        ASSERT_TRUE(client->remembersVersion(alice.at("Friends")));
+        if (isSaved) client->saveVersionMemory();
+        client.reset();
+        EXPECT_EQ(run()->remembersVersion(alice.at("Friends")), isSaved);
+    }
 }
 
 } // namespace
