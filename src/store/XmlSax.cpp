@@ -59,9 +59,7 @@ bool XmlSax::feed(std::string_view bytes) {
 
 bool XmlSax::finish() {
     if (_good && xmlParseChunk(_context, nullptr, 0, 1) != 0) _good = false;
-    // WebDAV's XML has to be well formed with its namespaces, too (RFC 4918 section 17): a name whose prefix nobody
-    // declared belongs nowhere.
-    return _good && _context->wellFormed == 1 && _context->nsWellFormed == 1;
+    return _good && _context->wellFormed == 1;
 }
 
 void XmlSax::refuse() {
@@ -69,12 +67,14 @@ void XmlSax::refuse() {
     xmlStopParser(_context);
 }
 
-void XmlSax::onStart(void* self, const xmlChar* local, const xmlChar*, const xmlChar* uri, int, const xmlChar**, int,
-                     int, const xmlChar**) {
+void XmlSax::onStart(void* self, const xmlChar* local, const xmlChar* prefix, const xmlChar* uri, int, const xmlChar**,
+                     int, int, const xmlChar**) {
     auto* sax = static_cast<XmlSax*>(self);
     if (!sax->_good) return;
     const std::string_view space = uri ? reinterpret_cast<const char*>(uri) : "";
     std::string name = reinterpret_cast<const char*>(local);
+    // A name with a prefix that nobody declared, or with half of one, belongs nowhere.
+    if ((prefix && !uri) || name.find(':') != std::string::npos) return sax->refuse();
     if (space != "DAV:") name = "{" + plainURI(space) + "}" + name;
     sax->_path.push_back(std::move(name));
     if (sax->_path.size() > sax->_maxDepth || !sax->opened(sax->_path)) sax->refuse();
