@@ -4,18 +4,26 @@
 #include "Lookup.h"
 #include "PersonFields.h"
 #include "RecordJson.h"
+#include "SafeText.h"
 #include "Subscriptions.h"
 
+#include "contacts/TextCharset.h"
 #include "contacts/VCardExport.h"
 #include "contacts/VCardImport.h"
+#include "foundation/PropertyList.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
 #include <filesystem>
 #include <fmt/format.h>
 #include <fstream>
+#include <functional>
 #include <iostream>
+#include <map>
+#include <set>
+#include <utility>
 
 namespace rolvane::cli {
 
@@ -27,10 +35,15 @@ using Json = nlohmann::ordered_json;
 
 struct ImportOptions {
     std::vector<std::string> files;
-    std::string group;
+    std::string charset;
+    bool dryRun = false;
 };
 
 void importCards(Context& context, const ImportOptions& options) {
+    if (!options.charset.empty() && !isKnownCharset(options.charset))
+        throw CommandError(kUsage, fmt::format("There is no character set \"{}\". `iconv --list` names those that "
+                                               "there are.",
+                                               options.charset));
     VCardImportReport report;
     size_t unreadable = 0; // files
     {
@@ -40,6 +53,8 @@ void importCards(Context& context, const ImportOptions& options) {
                 bar.update(static_cast<double>(progress.bytesDone) / static_cast<double>(progress.bytesTotal),
                            counted(progress.cards, "contact", "contacts"));
         });
+        import.setCharset(options.charset);
+        import.setDryRun(options.dryRun);
         for (const std::string& file : options.files) try {
                 if (file == "-")
                     import.addStream(std::cin, "standard input");
@@ -52,7 +67,7 @@ void importCards(Context& context, const ImportOptions& options) {
             }
         report = import.finish();
     }
-    reportImport(context, report, unreadable);
+    reportImport(context, report, unreadable, options.dryRun);
 }
 
 // export ---------------------------------------------------------------------------------------------------------
@@ -142,33 +157,70 @@ std::vector<CXListing> chosenPeople(Context& context, const ListOptions& options
     return people;
 }
 
-void list(Context& context, const ListOptions& options) {
-    const std::vector<CXListing> people = chosenPeople(context, options);
-    if (!context.json) {
-        for (const CXListing& person : people)
-            context.line(fmt::format("{}  {}{}", person.uniqueId.str(), person.displayName, ownerMark(person)));
-        return;
-    }
-    // Written one by one: a document of 100,000 people with photos need not stand in memory.
+// Everybody's rows, one by one: a document of 100,000 people with photos need not stand in memory.
+void forEachWhole(CXRolvane& database, const std::vector<CXListing>& people,
+                  const std::function<void(const CXRow&, const Dictionary&)>& call) {
+    std::vector<UniqueId> uids;
+    uids.reserve(people.size());
+    for (const CXListing& listed : people) uids.push_back(listed.uniqueId);
+    database.forEachOf(uids, [&](const CXRow& row) { call(row, BinaryValue::decode(*row.encoded).dictionary()); });
+}
+
+void listJson(Context& context, const std::vector<CXListing>& people, bool full) {
     context.line("[");
     bool first = true;
-    for (const CXListing& listed : people) {
-        Json data;
-        if (options.full) {
-            const auto person =
-                std::dynamic_pointer_cast<CXPerson>(context.database().recordForUniqueId(listed.uniqueId));
-            if (!person) continue; // deleted meanwhile
-            data = toJson(*person);
-        } else {
-            data = {{"identifier", listed.uniqueId.str()},
-                    {"name", listed.displayName},
-                    {"location", listed.location.empty() ? Json() : Json(listed.location.str())},
-                    {"owner", ownerJson(listed.location)}};
-        }
-        context.line(std::string(first ? "  " : ", ") + data.dump(-1, ' ', false, Json::error_handler_t::replace));
-        first = false;
+    const auto put = [&](const std::string& json) { context.line((std::exchange(first, false) ? "  " : ", ") + json); };
+    if (full) {
+        std::map<UniqueId, std::string> names;
+        for (const CXListing& group : context.database().listGroups(std::nullopt))
+            names[group.uniqueId] = group.displayName;
+        forEachWhole(context.database(), people, [&](const CXRow& row, const Dictionary& properties) {
+            std::vector<std::string> groups;
+            for (const UniqueId& parent : row.parentGroups) groups.push_back(names[parent]);
+            put(jsonText(row, properties, groups));
+        });
+    } else {
+        for (const CXListing& listed : people)
+            put(Json({{"identifier", listed.uniqueId.str()},
+                      {"name", listed.displayName},
+                      {"location", listed.location.empty() ? Json() : Json(listed.location.str())},
+                      {"owner", ownerJson(listed.location)}})
+                    .dump(-1, ' ', false, Json::error_handler_t::replace));
     }
     context.line("]");
+}
+
+std::string firstText(const Dictionary& properties, const char* property) {
+    const auto values = CXMultiValue::fromValue(properties[property]);
+    return values && !values->empty() ? values->entries().front().value.string() : std::string();
+}
+
+// Name, then a number or else a mail address: what people look for in a list.
+void listText(Context& context, const std::vector<CXListing>& people) {
+    constexpr size_t kNameColumns = 32, kLeastNameColumns = 12;
+    const size_t columns = context.dataColumns();
+    const size_t nameColumns =
+        columns == 0 ? kNameColumns : std::clamp<size_t>(columns / 2, kLeastNameColumns, kNameColumns);
+    size_t next = 0;
+    forEachWhole(context.database(), people, [&](const CXRow& row, const Dictionary& properties) {
+        while (next < people.size() && people[next].uniqueId != row.uniqueId) next++; // deleted meanwhile
+        std::string reach = firstText(properties, kCXPhoneProperty);
+        if (reach.empty()) reach = firstText(properties, kCXEmailProperty);
+        reach = shownLine(reach + (next < people.size() ? ownerMark(people[next]) : std::string()));
+        std::string name = shownLine(cxDisplayName(properties));
+        if (columns > 0 && !reach.empty()) name = cutTo(name, nameColumns);
+        const size_t taken = columnsOf(name);
+        if (!reach.empty()) name += std::string(taken < nameColumns ? nameColumns - taken : 0, ' ') + "  " + reach;
+        context.line(columns > 0 ? cutTo(name, columns) : name);
+    });
+}
+
+void list(Context& context, const ListOptions& options) {
+    const std::vector<CXListing> people = chosenPeople(context, options);
+    if (context.json) return listJson(context, people, options.full);
+    if (!options.full) return listText(context, people);
+    for (const CXListing& person : people)
+        context.line(fmt::format("{}  {}{}", person.uniqueId.str(), shownLine(person.displayName), ownerMark(person)));
 }
 
 void show(Context& context, const std::vector<std::string>& names) {
@@ -218,7 +270,7 @@ void edit(Context& context, const std::string& name, const PersonFields& fields)
 
 bool confirmed(Context& context, const std::string& question) {
     if (!::isatty(STDIN_FILENO)) return true;
-    std::cerr << question << " [y/N] " << std::flush;
+    std::cerr << shownLine(question) << " [y/N] " << std::flush;
     std::string answer;
     std::getline(std::cin, answer);
     if (answer == "y" || answer == "Y" || answer == "yes") return true;
@@ -246,9 +298,17 @@ void remove(Context& context, const std::vector<std::string>& names, bool yes) {
 void addContactCommands(CLI::App& app, Context& context) {
     const auto imports = std::make_shared<ImportOptions>();
     addCommand(
-        app, context, "import", "Take contacts and groups from vCard files",
+        app, context, "import", "Take contacts and groups from files of other programs",
         [&](CLI::App& command) {
-            command.add_option("files", imports->files, "vCard files (3.0 or 4.0); - reads standard input")->required();
+            command
+                .add_option("files", imports->files,
+                            "vCards (2.1, 3.0 or 4.0), CSV of Google, Outlook or Thunderbird, LDIF of Thunderbird; "
+                            "- reads standard input")
+                ->required();
+            command.add_option("--charset", imports->charset,
+                               "Character set of text that is not UTF-8 and names none, such as WINDOWS-1252; without "
+                               "it, such text is examined");
+            command.add_flag("--dry-run", imports->dryRun, "Tell what would happen, and change nothing");
         },
         [&context, imports] { importCards(context, *imports); });
 
@@ -272,7 +332,7 @@ void addContactCommands(CLI::App& app, Context& context) {
             command.add_option("text", lists->text, "Only those with this text in name, organisation, mail or phone");
             command.add_option("-g,--group", lists->group, "Only members of this group");
             declareWhose(command, lists->whose);
-            command.add_flag("--full", lists->full, "With --json: every property");
+            command.add_flag("--full", lists->full, "With the identifiers; with --json, every property");
         },
         [&context, lists] { list(context, *lists); });
 

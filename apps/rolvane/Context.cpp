@@ -1,6 +1,7 @@
 #include "Context.h"
 
 #include "Examples.h"
+#include "SafeText.h"
 
 #include "contacts/DamagedDatabase.h"
 #include "daemon/InstanceLock.h"
@@ -9,6 +10,7 @@
 #include <cmath>
 #include <fmt/format.h>
 #include <iostream>
+#include <sys/ioctl.h>
 #include <unistd.h>
 
 namespace rolvane::cli {
@@ -50,25 +52,31 @@ CXRolvane& Context::database() {
 }
 
 void Context::print(const nlohmann::ordered_json& data) {
-    std::cout << data.dump(2, ' ', false, nlohmann::json::error_handler_t::replace) << "\n";
+    std::cout << shownJson(data.dump(2, ' ', false, nlohmann::json::error_handler_t::replace)) << "\n";
 }
 
 void Context::line(const std::string& text) {
-    std::cout << text << "\n";
+    std::cout << shownText(text) << "\n";
 }
 
 void Context::say(const std::string& text) {
-    if (!quiet) std::cerr << text << "\n";
+    if (!quiet) std::cerr << shownText(text) << "\n";
 }
 
 void Context::warn(const std::string& text) {
-    std::cerr << text << "\n";
+    std::cerr << shownText(text) << "\n";
 }
 bool Context::talkIsTerminal() const {
     return ::isatty(STDERR_FILENO) == 1;
 }
 bool Context::dataIsTerminal() const {
     return ::isatty(STDOUT_FILENO) == 1;
+}
+
+size_t Context::dataColumns() const {
+    winsize size{};
+    if (!dataIsTerminal() || ::ioctl(STDOUT_FILENO, TIOCGWINSZ, &size) != 0) return 0;
+    return size.ws_col;
 }
 
 ProgressBar::ProgressBar(Context& context, std::string label) : _context(context), _label(std::move(label)) {}
@@ -87,7 +95,7 @@ void ProgressBar::update(double fraction, const std::string& note) {
         constexpr int width = 40;
         const int full = percent * width / 100;
         std::cerr << fmt::format("\r{} [{}{}] {:3}% {}\033[K", _label, std::string(static_cast<size_t>(full), '#'),
-                                 std::string(static_cast<size_t>(width - full), ' '), percent, note)
+                                 std::string(static_cast<size_t>(width - full), ' '), percent, shownLine(note))
                   << std::flush;
         _open = true;
         return;

@@ -35,6 +35,7 @@ private:
 };
 
 // What every command gets: where output goes, and the things that it works on, opened on first use.
+// Whatever is printed by these functions has nothing in it that steers a terminal (SafeText.h).
 // Data goes to standard output (a table for people, one JSON document with --json); talk goes to standard error.
 class Context {
 public:
@@ -55,6 +56,7 @@ public:
     void warn(const std::string& text);             // a line on standard error, always
     bool talkIsTerminal() const;                    // standard error is a terminal
     bool dataIsTerminal() const;
+    size_t dataColumns() const; // of the terminal that standard output is; 0 for any other
 
 private:
     struct Impl;
@@ -82,6 +84,7 @@ CLI::App* addCommand(CLI::App& parent, Context& context, const std::string& name
 
 // Each file of commands has one of these.
 void addContactCommands(CLI::App& app, Context& context);      // import export list show add edit delete
+void addDuplicateCommands(CLI::App& app, Context& context);    // duplicates merge
 void addGroupCommands(CLI::App& app, Context& context);        // group …
 void addAccountCommands(CLI::App& app, Context& context);      // account …
 void addSharingCommands(CLI::App& app, Context& context);      // publish unpublish sync

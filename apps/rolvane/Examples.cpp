@@ -10,6 +10,8 @@ const std::map<std::string, const char*>& examples() {
     static const std::map<std::string, const char*> all{
         {"new-database", "  rolvane new-database && rolvane import backup.vcf"},
         {"import", "  rolvane import friends.vcf work.vcf\n"
+                   "  rolvane import --charset WINDOWS-1252 --dry-run old.vcf\n"
+                   "  rolvane import google.csv thunderbird.ldif\n"
                    "  curl https://example.org/team.vcf | rolvane import -"},
         {"export", "  rolvane export -o everybody.vcf\n"
                    "  rolvane export --group Family --vcard 3 > family.vcf"},
@@ -21,6 +23,10 @@ const std::map<std::string, const char*>& examples() {
         {"add", "  rolvane add --first Ada --last Miller --phone \"mobile:+1 555 0100\" --group Family"},
         {"edit", "  rolvane edit \"Ada Miller\" --email work:ada@example.org --note \"\""},
         {"delete", "  rolvane delete \"Ada Miller\" --yes"},
+        {"duplicates", "  rolvane duplicates"},
+        {"merge", "  rolvane merge \"Ada Miller\" --dry-run\n"
+                  "  rolvane merge 4CA70A2B 9D01F3C7\n"
+                  "  rolvane merge --alike"},
         {"group create", "  rolvane group create Family \"Ada Miller\" \"Bob Miller\""},
         {"group add", "  rolvane group add Family \"Ada Miller\""},
         {"group remove", "  rolvane group remove Family \"Ada Miller\""},

@@ -6,8 +6,8 @@
 
 namespace rolvane::cli {
 
-// Tells what an import did, each bad card by itself, and sets the exit code. `unreadable`: files that could not be
-// read.
-void reportImport(Context& context, const VCardImportReport& report, size_t unreadable);
+// Tells what an import did, or would do: each bad card, each line that was kept or lost, each column without a place,
+// by itself; and sets the exit code. `unreadable`: files that could not be read.
+void reportImport(Context& context, const VCardImportReport& report, size_t unreadable, bool dryRun = false);
 
 } // namespace rolvane::cli

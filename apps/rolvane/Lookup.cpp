@@ -1,6 +1,7 @@
 #include "Lookup.h"
 
 #include "Context.h"
+#include "SafeText.h"
 #include "Subscriptions.h"
 
 #include <algorithm>
@@ -48,7 +49,8 @@ UniqueId only(const std::vector<CXListing>& found, const std::string& kind, cons
     constexpr size_t kShown = 10;
     std::string list;
     for (size_t i = 0; i < std::min(found.size(), kShown); ++i)
-        list += fmt::format("\n  {}  {}{}", found[i].uniqueId.str(), found[i].displayName, ownerMark(found[i]));
+        list +=
+            fmt::format("\n  {}  {}{}", found[i].uniqueId.str(), shownLine(found[i].displayName), ownerMark(found[i]));
     if (found.size() > kShown) list += fmt::format("\n  and {} more", found.size() - kShown);
     throw CommandError(kNotFound, fmt::format("\"{}\" fits {} {}. Name one by its identifier:{}", named, found.size(),
                                               kind == "person" ? "people" : "groups", list));
@@ -56,9 +58,26 @@ UniqueId only(const std::vector<CXListing>& found, const std::string& kind, cons
 
 } // namespace
 
+// The same rules for people, of whom there may be many: each rule asks an index.
+std::vector<CXListing> peopleMatching(CXRolvane& database, const std::string& named, bool whole) {
+    const bool mayBeIdentifier = named.size() >= kIdentifierStart;
+    std::vector<CXListing> begun;
+    if (mayBeIdentifier) begun = database.peopleNamed(named, CXRolvane::Named::byIdentifier);
+    for (const CXListing& listing : begun)
+        if (folded(listing.uniqueId.str()) == folded(named)) return {listing};
+    const auto byName = database.peopleNamed(named, CXRolvane::Named::whole);
+    std::vector<CXListing> exact;
+    for (const CXListing& listing : byName)
+        if (listing.displayName == named) exact.push_back(listing);
+    if (!exact.empty()) return exact;
+    if (!byName.empty()) return byName;
+    if (!begun.empty()) return begun;
+    return whole ? std::vector<CXListing>() : database.peopleNamed(named, CXRolvane::Named::part);
+}
+
 CXPersonRef findPerson(CXRolvane& database, const std::string& named, bool whole) {
     if (auto exact = std::dynamic_pointer_cast<CXPerson>(database.recordForUniqueId(UniqueId(named)))) return exact;
-    const UniqueId uid = only(matches(database.listPeople(std::nullopt), named, whole), "person", named);
+    const UniqueId uid = only(peopleMatching(database, named, whole), "person", named);
     return std::dynamic_pointer_cast<CXPerson>(database.recordForUniqueId(uid));
 }
 

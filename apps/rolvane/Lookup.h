@@ -3,6 +3,7 @@
 #include "contacts/CXRolvane.h"
 
 #include <string>
+#include <vector>
 
 namespace rolvane::cli {
 
@@ -10,6 +11,7 @@ namespace rolvane::cli {
 // case does not matter; an exact match wins over a part). Throws CommandError kNotFound when nothing or several match;
 // the message lists the candidates.
 // With `whole` a part of a name is not enough: for what cannot be taken back.
+std::vector<CXListing> peopleMatching(CXRolvane& database, const std::string& named, bool whole);
 CXPersonRef findPerson(CXRolvane& database, const std::string& named, bool whole = false);
 CXGroupRef findGroup(CXRolvane& database, const std::string& named, bool whole = false);
 

@@ -1,12 +1,16 @@
 #include "RecordJson.h"
 
+#include "SafeText.h"
 #include "Subscriptions.h"
 
 #include "contacts/Constants.h"
+#include "contacts/VCardFields.h"
 #include "foundation/Base64.h"
 
+#include <algorithm>
 #include <array>
 #include <fmt/format.h>
+#include <utility>
 
 namespace rolvane::cli {
 
@@ -75,6 +79,66 @@ Json toJson(CXPerson& person) {
             {"properties", toJson(Value(person.dictionaryRepresentation()))}};
 }
 
+namespace {
+
+void appendJson(std::string& out, std::string_view text) {
+    const bool plain =
+        std::all_of(text.begin(), text.end(), [](char c) { return c >= ' ' && c < '\x7F' && c != '"' && c != '\\'; });
+    if (plain)
+        (out += '"').append(text) += '"';
+    else
+        out += Json(text).dump(-1, ' ', false, Json::error_handler_t::replace);
+}
+
+void appendJson(std::string& out, const Value& value) {
+    if (const std::string* text = value.stringIf()) return appendJson(out, std::string_view(*text));
+    const char* separator = "";
+    if (const Array* array = value.arrayIf()) {
+        out += '[';
+        for (const Value& item : *array) {
+            out += std::exchange(separator, ",");
+            appendJson(out, item);
+        }
+        out += ']';
+    } else if (const Dictionary* object = value.dictionaryIf()) {
+        out += '{';
+        for (const auto& [key, item] : *object) {
+            out += std::exchange(separator, ",");
+            appendJson(out, std::string_view(key));
+            out += ':';
+            appendJson(out, item);
+        }
+        out += '}';
+    } else if (value.isData()) {
+        out += '"';
+        appendBase64(value.data().data(), value.data().size(), out);
+        out += '"';
+    } else {
+        out += toJson(value).dump();
+    }
+}
+
+} // namespace
+
+std::string jsonText(const CXRow& row, const Dictionary& properties, const std::vector<std::string>& groups) {
+    std::string out;
+    const auto field = [&](const char* name, const Value& value) {
+        ((out += out.empty() ? "{\"" : ",\"") += name) += "\":";
+        appendJson(out, value);
+    };
+    field("identifier", row.uniqueId.str());
+    field("name", cxDisplayName(properties));
+    field("location", row.location.empty() ? Value() : Value(row.location.str()));
+    out += ",\"owner\":" + ownerJson(row.location).dump();
+    field("created", row.created);
+    field("modified", row.modified);
+    Array names;
+    for (const std::string& group : groups) names.append(group);
+    field("groups", names);
+    field("properties", properties);
+    return out += '}';
+}
+
 Json toJson(CXGroup& group) {
     Json choices = Json::object();
     for (const auto& [person, chosen] : group.distributionChoices())
@@ -115,6 +179,29 @@ constexpr std::array<const char*, 7> kMultis{kCXPhoneProperty,     kCXEmailPrope
                                              kCXURLsProperty,      kCXInstantMessageProperty, kCXRelatedNamesProperty,
                                              kCXOtherDatesProperty};
 
+constexpr std::array<const char*, 12> kMonths{"January", "February", "March",     "April",   "May",      "June",
+                                              "July",    "August",   "September", "October", "November", "December"};
+
+std::string dayOfYear(int month, int day) {
+    return fmt::format("{} {}", day, kMonths.at(static_cast<size_t>(month - 1)));
+}
+
+// A day as people write it where its year is not known: of such a date 1604 is the filling.
+std::string dayText(const std::string& iso) {
+    const bool filled = iso.size() == 10 && iso.starts_with("1604-");
+    return filled ? dayOfYear(std::stoi(iso.substr(5, 2)), std::stoi(iso.substr(8, 2))) : iso;
+}
+
+// A birthday without its year, or with it alone, as vCards write it ("--0517", "1985-05").
+std::string birthdayText(const std::string& text) {
+    if (const std::string day = vcardDayOfYear(text); !day.empty())
+        return dayOfYear(std::stoi(day.substr(2, 2)), std::stoi(day.substr(4, 2)));
+    if (!vcardIsTruncatedDate(text) || text.size() != 7) return text;
+    const int month = std::stoi(text.substr(5));
+    if (month < 1 || month > 12) return text;
+    return fmt::format("{} {}", kMonths.at(static_cast<size_t>(month - 1)), text.substr(0, 4));
+}
+
 std::string oneLine(const Value& value) {
     if (const Dictionary* parts = value.dictionaryIf()) {
         std::string text;
@@ -130,7 +217,7 @@ std::string oneLine(const Value& value) {
         return text;
     }
     if (value.isData()) return fmt::format("{} bytes", value.data().size());
-    if (value.isDate()) return value.date()->toISO8601().substr(0, 10);
+    if (value.isDate()) return dayText(value.date()->toISO8601().substr(0, 10));
     return value.description();
 }
 
@@ -146,11 +233,14 @@ void addLine(std::string& text, const std::string& label, const std::string& val
 } // namespace
 
 std::string personText(CXPerson& person) {
-    std::string text = person.displayName() + "\n";
+    std::string text = shownLine(person.displayName()) + "\n";
     addLine(text, "Identifier", person.uniqueId().str());
     if (!person.remoteLocation().empty()) addLine(text, "From", fromText(person));
     for (const auto& [property, label] : kSingles)
-        if (const Value value = person.valueForProperty(property)) addLine(text, label, oneLine(value));
+        if (const Value value = person.valueForProperty(property)) {
+            const bool isBirthday = property == std::string_view(kCXBirthdayTextProperty);
+            addLine(text, label, isBirthday ? birthdayText(value.string()) : oneLine(value));
+        }
     for (const char* property : kMultis)
         if (const auto values = person.multiValueForProperty(property))
             for (const CXMultiValue::Entry& entry : values->entries())

@@ -4,6 +4,8 @@
 #include "foundation/Value.h"
 
 #include <nlohmann/json.hpp>
+#include <string>
+#include <vector>
 
 namespace rolvane::cli {
 
@@ -12,6 +14,9 @@ nlohmann::ordered_json toJson(const Value& value);
 
 // A person whole: identifier, name, location (subscribed ones), dates, groups, all properties.
 nlohmann::ordered_json toJson(CXPerson& person);
+// The same document of a row, with its decoded properties and the names of the groups, as text in one line. It is
+// written straight, for lists of very many.
+std::string jsonText(const CXRow& row, const Dictionary& properties, const std::vector<std::string>& groups);
 // A group whole: identifier, name, location, members, subgroups, distribution choices, what it is published at.
 nlohmann::ordered_json toJson(CXGroup& group);
 

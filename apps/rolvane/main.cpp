@@ -1,4 +1,5 @@
 #include "Context.h"
+#include "SafeText.h"
 
 #include <iostream>
 
@@ -57,7 +58,7 @@ int endWith(const CLI::App& app, const CLI::ParseError& error, int argc, char** 
     std::string what =
         unknown.empty() ? error.what() : "There is no command \"" + nameOf(*command) + " " + unknown + "\"";
     if (what.ends_with('.')) what.pop_back();
-    std::cerr << "rolvane: " << what << ". `" << nameOf(*command) << " --help` shows what can be given.\n";
+    std::cerr << shownText("rolvane: " + what + ". `" + nameOf(*command) + " --help` shows what can be given.\n");
     return kUsage;
 }
 
@@ -76,6 +77,7 @@ int main(int argc, char** argv) {
     app.add_flag("--json", context.json, "Print data as one JSON document");
     app.add_flag("-q,--quiet", context.quiet, "No messages but errors");
     addContactCommands(app, context);
+    addDuplicateCommands(app, context);
     addGroupCommands(app, context);
     addAccountCommands(app, context);
     addSharingCommands(app, context);
@@ -99,10 +101,10 @@ int main(int argc, char** argv) {
     } catch (const CLI::ParseError& error) {
         return endWith(app, error, argc, argv);
     } catch (const CommandError& error) {
-        std::cerr << "rolvane: " << error.reason() << "\n";
+        context.warn("rolvane: " + error.reason());
         return error.code();
     } catch (const CXException& error) {
-        std::cerr << "rolvane: " << error.reason() << "\n";
+        context.warn("rolvane: " + error.reason());
         return kFailed;
     }
 }

@@ -4,6 +4,7 @@
 #include "contacts/RolvaneImpl.h"
 #include "foundation/Log.h"
 #include "foundation/Paths.h"
+#include "foundation/PropertyList.h"
 
 #include <algorithm>
 #include <cerrno>
@@ -359,6 +360,54 @@ std::vector<CXListing> listing(CXRolvane::Impl& d, std::initializer_list<RecordK
 std::vector<CXListing> CXRolvane::listPeople(const std::optional<RemoteLocation>& location, std::string_view text) {
     std::lock_guard lock(_impl->mutex);
     return listing(*_impl, {RecordKind::person, RecordKind::subscribedPerson}, location, foldCase(text));
+}
+
+namespace {
+
+bool fits(const CXListing& listing, const std::string& wanted, CXRolvane::Named how) {
+    if (how == CXRolvane::Named::byIdentifier) return foldCase(listing.uniqueId.str()).starts_with(wanted);
+    const std::string name = foldCase(listing.displayName);
+    return how == CXRolvane::Named::whole ? name == wanted : name.find(wanted) != std::string::npos;
+}
+
+} // namespace
+
+std::vector<CXListing> CXRolvane::peopleNamed(const std::string& named, Named how) {
+    std::lock_guard lock(_impl->mutex);
+    if (!_impl->work.empty()) { // what is not saved stands in no index
+        auto all = listing(*_impl, {RecordKind::person, RecordKind::subscribedPerson}, std::nullopt, {});
+        std::erase_if(all, [&, wanted = foldCase(named)](const CXListing& l) { return !fits(l, wanted, how); });
+        return all;
+    }
+    std::vector<SortedListing> lines;
+    if (how != Named::byIdentifier) {
+        for (auto& line : _impl->store.linesNamed(named, how == Named::part))
+            lines.push_back({std::move(line.sort), {line.uid, std::move(line.display), RemoteLocation(line.location)}});
+        return inOrder(std::move(lines));
+    }
+    for (const UniqueId& uid : _impl->store.peopleWhoseIdentifierBegins(named))
+        if (const auto row = _impl->row(uid, false)) {
+            const auto columns = deriveColumns(_impl->kind(uid), BinaryValue::decode(*row->encoded).dictionary());
+            lines.push_back({columns.sort, {uid, columns.display, row->location}});
+        }
+    return inOrder(std::move(lines));
+}
+
+void CXRolvane::forEachOf(const std::vector<UniqueId>& uids, const std::function<void(const CXRow&)>& call) {
+    for (size_t from = 0; from < uids.size(); from += kPage) {
+        const size_t to = std::min<size_t>(uids.size(), from + kPage);
+        std::unique_lock lock(_impl->mutex);
+        std::vector<CXRow> rows;
+        if (_impl->work.empty()) {
+            rows = _impl->store.rowsOf({uids.begin() + static_cast<long>(from), uids.begin() + static_cast<long>(to)});
+        } else {
+            for (size_t i = from; i < to; i++)
+                if (auto row = isPerson(_impl->kind(uids[i])) ? _impl->row(uids[i], true) : std::nullopt)
+                    rows.push_back(std::move(*row));
+        }
+        lock.unlock();
+        for (const CXRow& row : rows) call(row);
+    }
 }
 
 std::vector<CXListing> CXRolvane::listGroups(const std::optional<RemoteLocation>& location) {

@@ -113,6 +113,12 @@ public:
     // People of one location (empty: the owner's own; nothing: all) in display order; with a text, only those whose
     // names, organisation, mails or phones contain it (letter case does not matter).
     std::vector<CXListing> listPeople(const std::optional<RemoteLocation>& location, std::string_view text = {});
+    // People of all locations in display order whose name is `named`, or has it in it, or whose identifier begins so;
+    // letter case of ASCII aside. By indexes: fast whatever the size of the database.
+    enum class Named { whole, part, byIdentifier };
+    std::vector<CXListing> peopleNamed(const std::string& named, Named how);
+    // The rows of people, in this order, in pages. Those that are not here are passed over.
+    void forEachOf(const std::vector<UniqueId>& uids, const std::function<void(const CXRow&)>& call);
     std::vector<CXListing> listGroups(const std::optional<RemoteLocation>& location); // by name
     size_t countPeople(const std::optional<RemoteLocation>& location);
 

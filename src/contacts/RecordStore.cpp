@@ -21,7 +21,7 @@ namespace rolvane {
 
 namespace {
 
-constexpr int kFormat = 4;
+constexpr int kFormat = 5;
 constexpr int64_t kApplicationId = 0x52564c43; // "RVLC"
 
 constexpr const char* kTables = R"(
@@ -41,6 +41,7 @@ CREATE TABLE records(
 CREATE INDEX records_modified ON records(kind, modified);
 CREATE INDEX records_location ON records(kind, location, id, uid);
 CREATE INDEX records_names ON records(id, uid, kind);
+CREATE INDEX records_display ON records(display COLLATE NOCASE, kind, uid, location, sort);
 CREATE TABLE listed(
   group_id INTEGER NOT NULL REFERENCES records(id) ON DELETE CASCADE,
   position INTEGER NOT NULL,
@@ -159,6 +160,7 @@ void RecordStore::makeOrCheckFormat() {
     if (format == 1) format = addWriters();
     if (format == 2) format = addNames();
     if (format == 3) format = addCommonVersions();
+    if (format == 4) format = addDisplayNames();
     if (format > kFormat)
         throw CXException(kCXDatabaseException, "The contact database " + _database.path() +
                                                     " was written by a newer version (format " +
@@ -191,6 +193,16 @@ int64_t RecordStore::addCommonVersions() {
     SqliteTransaction transaction(_database);
     if (_database.integer("PRAGMA user_version") == 3) // nobody else did it meanwhile
         _database.execute(std::string(CommonVersions::kTable) + ConflictLog::kTable + "PRAGMA user_version=4;");
+    transaction.commit();
+    return _database.integer("PRAGMA user_version");
+}
+
+// Format 4 found a person by name only by a look at everybody.
+int64_t RecordStore::addDisplayNames() {
+    SqliteTransaction transaction(_database);
+    if (_database.integer("PRAGMA user_version") == 4) // nobody else did it meanwhile
+        _database.execute("CREATE INDEX IF NOT EXISTS records_display ON "
+                          "records(display COLLATE NOCASE, kind, uid, location, sort); PRAGMA user_version=5;");
     transaction.commit();
     return _database.integer("PRAGMA user_version");
 }
@@ -450,6 +462,45 @@ void RecordStore::addParents(std::vector<CXRow>& rows, const std::vector<int64_t
         if (group.empty()) group = UniqueId(s.text(2));
         rows[static_cast<size_t>(s.integer(0))].parentGroups.push_back(group);
     }
+}
+
+std::vector<RecordStore::Line> RecordStore::linesNamed(std::string_view name, bool partOfName) {
+    auto s =
+        _database.statement(partOfName ? "SELECT uid, location, display, sort FROM records INDEXED BY records_display "
+                                         "WHERE kind IN (1,2) AND instr(lower(display), lower(?1)) > 0"
+                                       : "SELECT uid, location, display, sort FROM records INDEXED BY records_display "
+                                         "WHERE display=?1 COLLATE NOCASE AND kind IN (1,2)");
+    s.bind(1, name);
+    std::vector<Line> lines;
+    while (s.step()) lines.push_back({UniqueId(s.text(0)), s.text(1), s.text(2), s.text(3), ""});
+    return lines;
+}
+
+std::vector<UniqueId> RecordStore::peopleWhoseIdentifierBegins(std::string_view start) {
+    auto s = _database.statement("SELECT uid FROM records INDEXED BY records_names "
+                                 "WHERE kind IN (1,2) AND substr(uid, 1, length(?1))=?1 COLLATE NOCASE");
+    s.bind(1, start);
+    std::vector<UniqueId> uids;
+    while (s.step()) uids.emplace_back(s.text(0));
+    return uids;
+}
+
+std::vector<CXRow> RecordStore::rowsOf(const std::vector<UniqueId>& uids) {
+    SqliteSnapshot snapshot(_database);
+    std::vector<CXRow> rows;
+    std::vector<int64_t> ids;
+    auto s = _database.statement("SELECT id, uid, location, created, modified, properties, writer FROM records "
+                                 "WHERE uid=?1 AND kind IN (1,2)");
+    for (const UniqueId& uid : uids) {
+        s.bind(1, uid.str());
+        if (s.step()) {
+            ids.push_back(s.integer(0));
+            rows.push_back(rowOf(s));
+        }
+        s.reset();
+    }
+    addParents(rows, ids);
+    return rows;
 }
 
 void RecordStore::forEachLine(RecordKind kind, const std::function<void(Line)>& call) {

@@ -79,6 +79,12 @@ public:
         UniqueId uid;
         std::string location, display, sort, search;
     };
+    // The same of the people whose name is this (letter case of ASCII aside), or has this in it; by an index of names.
+    std::vector<Line> linesNamed(std::string_view name, bool partOfName);
+    // Identifiers of people that begin so, letter case aside.
+    std::vector<UniqueId> peopleWhoseIdentifierBegins(std::string_view start);
+    // Rows with their parents, in this order; those that are not there are left out.
+    std::vector<CXRow> rowsOf(const std::vector<UniqueId>& uids);
     void forEachLine(RecordKind kind, const std::function<void(Line)>& call);
 
     // Past the indexes, or by one of them alone: for finding out which of them is damaged --------------------------
@@ -124,6 +130,7 @@ private:
     int64_t addWriters(); // the format then
     int64_t addNames();
     int64_t addCommonVersions();
+    int64_t addDisplayNames();
     void fillNewDatabase();
     [[noreturn]] void outOfOrder();
     std::vector<CXRow> rowsWithParents(Sqlite::Statement& s, int positionColumn, int64_t& position);

@@ -23,6 +23,19 @@ std::string keptUID(const Dictionary& properties) {
     return "";
 }
 
+// Categories by name, but in the order of the card that the person came with.
+void putInOrder(VCardEntity& card) {
+    auto& names = card.categories;
+    std::sort(names.begin(), names.end());
+    const auto lines = vcardKeptLines(card.properties, kVCardCategoryOrderLine);
+    if (lines.empty()) return;
+    const auto order = vcardDecodeList(lines.front());
+    std::stable_sort(names.begin(), names.end(), [&](const std::string& a, const std::string& b) {
+        return std::find(order.begin(), order.end(), a) < std::find(order.begin(), order.end(), b);
+    });
+    vcardReplaceKeptLines(card.properties, kVCardCategoryOrderLine, {});
+}
+
 std::string trimmedUID(std::string uid) {
     while (!uid.empty() && (uid.back() == ' ' || uid.back() == '\t')) uid.pop_back();
     return uid;
@@ -85,6 +98,7 @@ void VCardExport::writePerson(const UniqueId& uid, const Dictionary& properties,
         auto name = _groupNames.find(parent);
         if (name != _groupNames.end()) card.categories.push_back(name->second);
     }
+    putInOrder(card);
     write(card);
     if (_onProgress) _onProgress(_written.size(), std::max(_total, _written.size()));
 }
@@ -113,6 +127,10 @@ void VCardExport::writeGroup(const CXGroupRef& group) {
         std::string kept = trimmedUID(keptUID(subgroup->dictionaryRepresentation()));
         card.subgroups.push_back(kept.empty() ? vcardUIDForUUID(cxUUIDPart(subgroup->uniqueId())) : kept);
     }
+    // Members whose cards never came are named like the others.
+    for (const auto& line : vcardKeptLines(card.properties, kVCardMissingMemberLine))
+        card.members.push_back(vcardUnescape(line.value));
+    vcardReplaceKeptLines(card.properties, kVCardMissingMemberLine, {});
     addChoices(card, group);
     write(card);
 }

@@ -206,6 +206,7 @@ const VCardMultiField* vcardMultiFieldForLine(std::string_view lineName, bool la
     for (const auto& f : kMultiFields) {
         if (lineName == f.lineName && (f.inVersion3 || f.inVersion4)) return &f;
         if (own == f.lineName) return &f;
+        if (lineName == "X-ABDATE" && f.property == std::string_view(kCXOtherDatesProperty)) return &f;
         bool suffixed = *f.xSuffix && lineName.starts_with("X-") && lineName.ends_with(f.xSuffix);
         if (labelled && suffixed) return &f;
     }
@@ -285,6 +286,13 @@ std::string vcardEncodeName(const Dictionary& person) {
         raw += vcardEscape(textOf(person, kNameKeys[i]));
     }
     return raw;
+}
+
+std::string vcardListedName(const VCardLine& line) {
+    if (line.name != "N") return "";
+    for (auto part : vcardSplit(line.value, ';'))
+        if (vcardSplit(part, ',').size() > 1) return line.value;
+    return "";
 }
 
 std::string vcardSurplusParts(const VCardLine& line) {
@@ -440,6 +448,22 @@ bool vcardIsTruncatedDate(std::string_view t) {
     if (t.size() == 7) return digits(t.substr(0, 4)) && t[4] == '-' && digits(t.substr(5)); // 1985-04
     if (t.size() == 6) return t.starts_with("--") && digits(t.substr(2));                   // --0412
     return t.size() == 5 && t.starts_with("---") && digits(t.substr(3));                    // ---12
+}
+
+std::string vcardDayOfYear(std::string_view t) {
+    std::string plain(t);
+    if (plain.size() == 7 && plain[4] == '-') plain.erase(4, 1);
+    if (plain.size() != 6 || !plain.starts_with("--") || !digits(std::string_view(plain).substr(2))) return "";
+    // 1604 was a leap year.
+    return decodeDay("1604" + plain.substr(2)) ? plain : std::string();
+}
+
+int vcardOmittedYear(const VCardLine& line) {
+    for (const auto& p : line.parameters) {
+        const bool named = p.name.starts_with("X-") && p.name.ends_with("OMIT-YEAR") && p.values.size() == 1;
+        if (named && p.values[0].size() == 4 && digits(p.values[0])) return number(p.values[0]);
+    }
+    return 0;
 }
 
 std::optional<VCardPhoto> vcardDecodePhoto(const VCardLine& line, std::string& reason) {

@@ -41,6 +41,8 @@ bool vcardIsPlainText(std::string_view text);
 // N: the five parts into and out of the person's dictionary. Lists inside a part are joined.
 void vcardDecodeName(const VCardLine& line, Dictionary& person);
 std::string vcardEncodeName(const Dictionary& person);
+// The raw value of an N whose parts are lists, of which the dictionary has only the joined text; "" for any other line.
+std::string vcardListedName(const VCardLine& line);
 // The parts of an ADR or N behind those that have a place in the dictionary (RFC 9554 knows some), raw; "" for none.
 std::string vcardSurplusParts(const VCardLine& line);
 // ORG: organisation and its units; several units are one department, separated by "; ".
@@ -70,8 +72,13 @@ bool vcardIsNeverExact(std::string_view property);
 // Anything else, the truncated forms of vCard 4.0 among it, is nothing.
 std::optional<Date> vcardDecodeDate(std::string_view text);
 std::string vcardEncodeDate(Date date, bool version4);
+// A birthday whose year is a mere filling is a full date with a parameter that names the year: "X-…-OMIT-YEAR=1604".
+// That year, 0 for none.
+int vcardOmittedYear(const VCardLine& line);
 // A truncated date of vCard 4.0 ("--0412", "1985-04", "---12"), which needs no VALUE=text.
 bool vcardIsTruncatedDate(std::string_view text);
+// The day of a year in the forms "--0412" and "--04-12", as "--0412"; "" for any other text.
+std::string vcardDayOfYear(std::string_view text);
 
 struct VCardPhoto {
     Bytes bytes;

@@ -41,9 +41,12 @@ bool has(const std::vector<std::string>& types, std::string_view type) {
     return std::find(types.begin(), types.end(), type) != types.end();
 }
 
-bool goesWithoutSaying(std::string_view name, std::string_view type) {
-    return type.empty() || (name == "TEL" && type == "voice") || (name == "EMAIL" && type == "internet");
-}
+constexpr std::string_view kCommonStart = "_$!<", kCommonEnd = ">!$_";
+
+// Labels that programs have in common, beside those that TYPE says.
+constexpr std::array<std::string_view, 14> kCommonLabels{
+    kCXAnniversaryLabel, kCXHomePageLabel, kCXOtherLabel, "Spouse",  "Partner",  "Child", "Parent", "Mother", "Father",
+    "Brother",           "Sister",         "Friend",      "Manager", "Assistant"};
 
 bool mereManner(std::string_view type) {
     for (auto t : {"pref", "voice", "internet", "msg", "text", "x400", "dom", "intl", "postal", "parcel"})
@@ -63,6 +66,25 @@ std::string vcardLabelForTypes(std::string_view name, const std::vector<std::str
     return "";
 }
 
+std::string vcardLabelFromText(const std::string& text) {
+    const bool common = text.size() > kCommonStart.size() + kCommonEnd.size() && text.starts_with(kCommonStart) &&
+                        text.ends_with(kCommonEnd);
+    if (!common) return text;
+    std::string word = text.substr(kCommonStart.size(), text.size() - kCommonStart.size() - kCommonEnd.size());
+    for (const auto& m : kMappings)
+        if (vcardEqualNoCase(m.label, word)) return std::string(m.label);
+    for (const auto label : kCommonLabels)
+        if (vcardEqualNoCase(label, word)) return std::string(label);
+    return word;
+}
+
+std::optional<std::string> vcardTextForLabel(const std::string& label) {
+    if (vcardTrim(label).empty()) return std::nullopt;
+    const bool common = std::find(kCommonLabels.begin(), kCommonLabels.end(), label) != kCommonLabels.end();
+    std::string text = common ? std::string(kCommonStart) += label + std::string(kCommonEnd) : label;
+    return vcardLabelFromText(text) == label ? std::optional(text) : std::nullopt;
+}
+
 std::vector<std::string> vcardTypesForLabel(std::string_view name, std::string_view label) {
     for (const auto& m : kMappings) {
         if ((!m.name.empty() && m.name != name) || m.label != label) continue;
@@ -79,7 +101,7 @@ std::vector<std::string> vcardTypesForLabel(std::string_view name, std::string_v
 bool vcardTypesAddToLabel(std::string_view name, std::string_view label, const std::vector<std::string>& types) {
     auto expected = vcardTypesForLabel(name, label);
     for (const auto& t : types)
-        if (!goesWithoutSaying(name, t) && !has(expected, t)) return true;
+        if (!t.empty() && !has(expected, t)) return true;
     return false;
 }
 

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -13,11 +14,17 @@ namespace rolvane {
 // ("Car"); "" when the types say nothing.
 std::string vcardLabelForTypes(std::string_view name, const std::vector<std::string>& types);
 
+// The label that the text of an X-ABLabel means: the words that programs have in common stand in it as
+// "_$!<HomeFAX>!$_", everything else as it is.
+std::string vcardLabelFromText(const std::string& text);
+
+// The text to write for a label in an X-ABLabel; nothing when reading it would give another label.
+std::optional<std::string> vcardTextForLabel(const std::string& label);
+
 // The types to write for a label; empty for a label that no types express. `vcardLabelForTypes` of them is the label.
 std::vector<std::string> vcardTypesForLabel(std::string_view name, std::string_view label);
 
-// Types that say something about a value besides its label: not those of `vcardTypesForLabel`, and not the ones that
-// go without saying ("voice" of a telephone, "internet" of a mail address).
+// Types that say something about a value besides its label: not those of `vcardTypesForLabel`.
 bool vcardTypesAddToLabel(std::string_view name, std::string_view label, const std::vector<std::string>& types);
 
 } // namespace rolvane

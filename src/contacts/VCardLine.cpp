@@ -2,6 +2,8 @@
 
 #include "contacts/VCardText.h"
 
+#include <algorithm>
+
 namespace rolvane {
 
 namespace {
@@ -58,9 +60,57 @@ public:
         return line;
     }
 
+    // Parameters that cannot be read are passed over.
+    std::optional<VCardLine> parseDamaged() {
+        VCardLine line;
+        std::string_view first = name();
+        if (at('.')) {
+            _i++;
+            line.group = std::string(first);
+            first = name();
+        }
+        line.name = vcardUpper(first);
+        while (!first.empty() && at(';')) {
+            const size_t start = ++_i;
+            const VCardLine before = line;
+            if (parameter(line) && (at(';') || at(':'))) continue;
+            line = before;
+            _i = start;
+            takeBracketed(line, passParameter());
+        }
+        if (first.empty() || !at(':')) return std::nullopt;
+        line.value = std::string(_t.substr(_i + 1));
+        return line;
+    }
+
     std::string reason;
 
 private:
+    // The text of a parameter up to the next one or the value; what stands in brackets belongs to it.
+    std::string_view passParameter() {
+        const size_t start = _i;
+        for (int depth = 0; _i < _t.size(); _i++) {
+            const char c = _t[_i];
+            if (c == '(') depth++;
+            if (c == ')') depth--;
+            if (depth <= 0 && (c == ';' || c == ':')) break;
+        }
+        if (_i == _t.size()) _i = std::min(_t.find_first_of(";:", start), _t.size()); // a bracket that nothing closes
+        return _t.substr(start, _i - start);
+    }
+
+    static void takeBracketed(VCardLine& line, std::string_view text) {
+        const size_t open = text.find('('), close = text.rfind(')');
+        if (open == std::string_view::npos || close == std::string_view::npos || close < open) return;
+        if (!vcardEqualNoCase(text.substr(0, open), "X-CUSTOM")) return;
+        const std::string_view inside = text.substr(open + 1, close - open - 1);
+        const size_t comma = inside.rfind(',');
+        std::string label(inside.substr(comma == std::string_view::npos ? 0 : comma + 1));
+        if (vcardUpper(inside).find("QUOTED-PRINTABLE") != std::string::npos) label = vcardDecodeQuotedPrintable(label);
+        if (!label.empty() && !vcardFirstInvalidUTF8(label) && !vcardHasControlCharacter(label))
+            line.add("TYPE", label);
+    }
+
     bool at(char c) const { return _i < _t.size() && _t[_i] == c; }
 
     std::nullopt_t fail(const char* why) {
@@ -205,6 +255,10 @@ std::optional<VCardLine> vcardParseLine(std::string_view text, bool version21, s
     auto line = parser.parse();
     if (!line && reason) *reason = parser.reason;
     return line;
+}
+
+std::optional<VCardLine> vcardParseDamagedLine(std::string_view text) {
+    return Parser(text, true).parseDamaged();
 }
 
 std::string vcardFormatLine(const VCardLine& line) {

@@ -45,6 +45,11 @@ struct VCardLine {
 // content line; `reason`, when given, then says why.
 std::optional<VCardLine> vcardParseLine(std::string_view text, bool version21 = false, std::string* reason = nullptr);
 
+// What can be made of a text that is no content line because of its parameters: those that cannot be read are passed
+// over, but for the label in the brackets of "X-CUSTOM(CHARSET=UTF-8,ENCODING=QUOTED-PRINTABLE,=4D)", which becomes a
+// TYPE. Nothing when there is no name or no value.
+std::optional<VCardLine> vcardParseDamagedLine(std::string_view text);
+
 // The line as text without folding and line end. Parameter values are quoted where they must be, and characters that
 // no quoting can carry go as RFC 6868 escapes.
 std::string vcardFormatLine(const VCardLine& line);

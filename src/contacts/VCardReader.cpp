@@ -3,12 +3,14 @@
 #include "contacts/CXMultiValue.h"
 #include "contacts/Constants.h"
 #include "contacts/VCardFields.h"
+#include "contacts/VCardKept.h"
 #include "contacts/VCardLabels.h"
 #include "contacts/VCardText.h"
 #include "foundation/CXException.h"
 #include "foundation/PropertyList.h"
 
 #include <algorithm>
+#include <cstdio>
 #include <iterator>
 #include <map>
 #include <set>
@@ -42,18 +44,21 @@ public:
 
     std::optional<VCardEntity> read() {
         _entity.line = _card.firstLine;
+        _entity.notices = _card.notices;
         studyGroups();
         for (const auto& line : _card.lines)
             if (!take(line)) return std::nullopt;
         keepUnusedLabels();
         storeMultiValues();
-        if (!applyExactValues()) return std::nullopt;
+        applyExactValues();
         finishNames();
         if (_entity.isGroup && !_entity.properties[kCXGroupNameProperty])
             return bad(_card.firstLine, "the group has no name (FN)");
         bool nothing =
             _entity.properties.empty() && _extras.empty() && _entity.categories.empty() && _entity.uid.empty();
         if (nothing) return bad(_card.firstLine, "the card is empty");
+        if (!_entity.notices.empty() && isAllUnread())
+            return bad(_entity.notices.front().line, _entity.notices.front().reason);
         storeExtras();
         return std::move(_entity);
     }
@@ -88,14 +93,40 @@ private:
     // Custom labels, and whether this is a group's card.
     void studyGroups() {
         for (const auto& line : _card.lines) {
-            if (vcardIsLabelLine(line)) _labels.emplace(line.group, vcardUnescape(line.value));
+            if (vcardIsLabelLine(line) && !saysNothing(line)) _labels.emplace(line.group, labelIn(line));
             if (isKindLine(line) && vcardEqualNoCase(vcardTrim(line.value), "group")) _entity.isGroup = true;
         }
+    }
+
+    static std::string labelIn(const VCardLine& line) {
+        std::string text = vcardUnescape(line.value);
+        return line.name == "X-ABLABEL" ? vcardLabelFromText(text) : text;
+    }
+
+    // Many programs write empty labels. Only ours means it.
+    static bool saysNothing(const VCardLine& label) {
+        return label.name != "X-ROLVANE-LABEL" && vcardTrim(label.value).empty();
+    }
+
+    bool isAllUnread() const {
+        if (!_entity.properties.empty() || !_entity.categories.empty() || !_entity.uid.empty()) return false;
+        return std::all_of(_extras.begin(), _extras.end(),
+                           [](const std::string& e) { return e.starts_with(kVCardUnreadLine); });
+    }
+
+    // Keeps a line whose value is damaged as it stands, under a name that says so.
+    void keepUnread(const VCardLine& line, std::string reason) {
+        VCardLine kept;
+        kept.name = kVCardUnreadLine;
+        kept.value = vcardEscape(vcardFormatLine(line));
+        keep(kept);
+        _entity.notices.push_back({line.number, std::move(reason)});
     }
 
     bool take(const VCardLine& line) {
         if (vcardIsLabelLine(line)) return _labelLines.push_back(&line), true;
         if (line.name == "PRODID" || line.name == "REV") return true; // of the file that was, not of the person
+        if (line.name == "PROFILE" && vcardEqualNoCase(vcardTrim(line.value), "VCARD")) return true;
         if (line.name == "UID") return takeUID(line);
         if (isKindLine(line)) return takeKind(line);
         if (line.name == "X-ROLVANE-VALUE") return takeExactValue(line);
@@ -188,7 +219,7 @@ private:
     bool takePhoto(const VCardLine& line) {
         std::string reason;
         auto photo = vcardDecodePhoto(line, reason);
-        if (!reason.empty()) return bad(line.number, reason), false;
+        if (!reason.empty()) return keepUnread(line, reason), true;
         bool usable = photo && !photo->bytes.empty() && !_entity.properties[kCXPhotoProperty] && !_entity.isGroup;
         if (!usable) {
             if (!line.value.empty()) keep(line);
@@ -258,11 +289,15 @@ private:
     static void decodeBirthday(const VCardLine& line, Dictionary& said) {
         if (vcardTrim(line.value).empty()) return;
         bool isText = vcardEqualNoCase(line.firstValueOf("VALUE"), "text");
-        auto date = isText ? std::nullopt : vcardDecodeDate(line.value);
+        const std::string day = vcardDayOfYear(vcardTrim(line.value));
+        const int filling = day.empty() ? 0 : vcardOmittedYear(line);
+        char full[16] = "";
+        if (filling > 0) std::snprintf(full, sizeof full, "%04d%s", filling, day.substr(2).c_str());
+        auto date = isText ? std::nullopt : vcardDecodeDate(filling > 0 ? std::string(full) : line.value);
         if (date)
             said.set(kCXBirthdayProperty, *date);
         else
-            said.set(kCXBirthdayTextProperty, vcardUnescape(line.value));
+            said.set(kCXBirthdayTextProperty, day.empty() ? vcardUnescape(line.value) : day);
     }
 
     // The value of such a line is written anew, so its carrier is finished when all is read.
@@ -273,12 +308,13 @@ private:
     }
 
     static bool saysMore(const VCardLine& line) {
-        return !line.group.empty() || !line.parameters.empty() || !vcardSurplusParts(line).empty();
+        return !line.group.empty() || !line.parameters.empty() || !vcardSurplusParts(line).empty() ||
+               !vcardListedName(line).empty();
     }
 
     // Parameters of any line that are used up or written anew.
     static bool isSpent(const VCardParameter& p) {
-        return p.name == "VALUE" || p.name == "ENCODING" || p.name == "X-ROLVANE-REST";
+        return p.name == "VALUE" || p.name == "ENCODING" || p.name == "X-ROLVANE-REST" || p.name == "X-ROLVANE-RAW";
     }
 
     // How many written lines a group name holds together, their labels aside.
@@ -295,8 +331,8 @@ private:
     // Labels of nothing that has one, and further labels of what has one already.
     void keepUnusedLabels() {
         for (const VCardLine* line : _labelLines) {
-            bool said = _usedLabels.count(line->group) && _labels[line->group] == vcardUnescape(line->value);
-            if (!said) keep(*line);
+            bool said = _usedLabels.count(line->group) && _labels[line->group] == labelIn(*line);
+            if (!said && !saysNothing(*line)) keep(*line);
         }
     }
 
@@ -307,19 +343,21 @@ private:
         return true;
     }
 
-    bool applyExactValues() {
-        for (const auto& [name, line] : _exact) {
-            _entity.properties.remove(name);
-            if (line->value.empty()) continue;
-            auto bytes = vcardDecodeBase64(line->value);
-            if (!bytes) return bad(line->number, "the base64 of the property " + name + " is damaged"), false;
+    void applyExactValues() {
+        std::erase_if(_exact, [&](const auto& exact) {
+            const auto& [name, line] = exact;
+            Value value;
             try {
-                _entity.properties.set(name, BinaryValue::decode(*bytes));
+                auto bytes = vcardDecodeBase64(line->value);
+                if (!bytes) return keepUnread(*line, "the base64 of the property " + name + " is damaged"), true;
+                if (!bytes->empty()) value = BinaryValue::decode(*bytes);
             } catch (const CXException& e) {
-                return bad(line->number, "the value of the property " + name + " is damaged: " + e.reason()), false;
+                return keepUnread(*line, "the value of the property " + name + " is damaged: " + e.reason()), true;
             }
-        }
-        return true;
+            _entity.properties.remove(name);
+            if (value) _entity.properties.set(name, std::move(value));
+            return false;
+        });
     }
 
     void storeMultiValues() {
@@ -373,6 +411,8 @@ private:
     }
 
     static bool addSurplus(const VCardLine& line, VCardLine& carrier) {
+        std::string listed = vcardListedName(line);
+        if (!listed.empty()) return carrier.add("X-ROLVANE-RAW", listed), true;
         std::string surplus = vcardSurplusParts(line);
         if (!surplus.empty()) carrier.add("X-ROLVANE-REST", surplus);
         return !surplus.empty();
@@ -458,8 +498,10 @@ private:
     }
 
     void keep(const VCardLine& line) {
+        const auto kept = vcardKeptForm(line);
+        if (!kept) return keepUnread(line, "the base64 of " + line.name + " is damaged");
         use(line.group);
-        _extras.push_back(vcardFormatLine(line));
+        _extras.push_back(vcardFormatLine(*kept));
     }
 
     const VCard& _card;
@@ -483,6 +525,35 @@ private:
 
 std::optional<VCardEntity> vcardEntityFromCard(const VCard& card, VCardError& error) {
     return Reader(card, error).read();
+}
+
+std::vector<VCardLine> vcardKeptLines(const Dictionary& properties, std::string_view name) {
+    std::vector<VCardLine> lines;
+    const Array* extras = properties[kCXVCardExtraProperty].arrayIf();
+    for (size_t i = 0; extras && i < extras->count(); i++) {
+        const std::string& text = (*extras)[i].string();
+        if (!text.starts_with(name)) continue;
+        auto line = vcardParseLine(text);
+        if (line && line->name == name) lines.push_back(std::move(*line));
+    }
+    return lines;
+}
+
+void vcardReplaceKeptLines(Dictionary& properties, std::string_view name, const std::vector<VCardLine>& lines) {
+    std::vector<std::string> texts;
+    if (const Array* extras = properties[kCXVCardExtraProperty].arrayIf())
+        for (const auto& extra : *extras) {
+            const auto line = extra.string().starts_with(name) ? vcardParseLine(extra.string()) : std::nullopt;
+            if (!line || line->name != name) texts.push_back(extra.string());
+        }
+    for (const auto& line : lines) texts.push_back(vcardFormatLine(line));
+    std::sort(texts.begin(), texts.end());
+    Array all;
+    for (auto& text : texts) all.append(std::move(text));
+    if (all.empty())
+        properties.remove(kCXVCardExtraProperty);
+    else
+        properties.set(kCXVCardExtraProperty, all);
 }
 
 std::string vcardMemberKey(std::string_view uid) {

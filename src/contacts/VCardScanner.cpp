@@ -89,6 +89,17 @@ bool looksLikeBase64(const std::string& text) {
            std::string::npos;
 }
 
+bool saysItsCharset(const std::string& text) {
+    return headOf(text).find("CHARSET") != std::string::npos;
+}
+
+// What is read of a damaged line when it is of a person; anything else is only kept.
+bool isOfPerson(std::string_view name) {
+    for (std::string_view known : {"FN", "N", "NICKNAME", "ORG", "TITLE", "NOTE", "TEL", "EMAIL", "ADR", "URL"})
+        if (name == known) return true;
+    return false;
+}
+
 } // namespace
 
 VCardScanner::VCardScanner(std::istream& in, std::string fileName, ErrorHandler onError, VCardLimits limits)
@@ -267,32 +278,58 @@ std::optional<std::string> VCardScanner::nestedCard() {
 
 bool VCardScanner::addLine(VCard& card, Unfolded& line) {
     if (line.tooLong) {
-        reject(line.number, "the line is longer than " + sizeText(_limits.lineBytes));
-        return false;
+        card.notices.push_back({line.number, "the line is longer than " + sizeText(_limits.lineBytes), true});
+        return true;
     }
     if (isBlank(line.text)) return true;
-    std::string reason;
-    auto parsed = vcardParseLine(line.text, _version21, &reason);
-    bool good = parsed.has_value();
-    if (good) {
-        parsed->number = line.number;
-        good = decodeLine(*parsed, reason);
-    } else if (vcardFirstInvalidUTF8(line.text)) {
-        reason = "the text is not UTF-8";
+    std::string converted, reason;
+    if (!_fallback.empty() && vcardFirstInvalidUTF8(line.text) && !saysItsCharset(line.text)) {
+        converted = line.text;
+        convertByFallback(converted);
     }
-    if (good && (parsed->name == "BEGIN" || parsed->name == "END")) {
+    auto parsed = vcardParseLine(converted.empty() ? line.text : converted, _version21, &reason);
+    if (parsed) parsed->number = line.number;
+    if (!parsed || !decodeLine(*parsed, reason)) return addUnread(card, line, reason), true;
+    if (parsed->name == "BEGIN" || parsed->name == "END") {
         // A damaged mark: what follows may be another card's.
-        reason = "the line " + parsed->name + " is neither BEGIN:VCARD nor END:VCARD";
-        good = false;
+        reject(line.number, "the line " + parsed->name + " is neither BEGIN:VCARD nor END:VCARD");
+        return false;
     }
-    if (good && parsed->name == "VERSION") {
-        good = setVersion(card, *parsed, reason);
-        _version21 = card.version == "2.1";
-    } else if (good) {
-        card.lines.push_back(std::move(*parsed));
+    if (parsed->name != "VERSION") return card.lines.push_back(std::move(*parsed)), true;
+    if (!setVersion(card, *parsed, reason)) return reject(line.number, reason), false;
+    _version21 = card.version == "2.1";
+    return true;
+}
+
+// The line as it stands, and what can be made of its value.
+void VCardScanner::addUnread(VCard& card, const Unfolded& line, const std::string& reason) {
+    VCardLine kept;
+    kept.name = kVCardUnreadLine;
+    kept.number = line.number;
+    if (vcardFirstInvalidUTF8(line.text) || vcardHasControlCharacter(line.text)) {
+        kept.add("X-BASE64", "1");
+        kept.value = vcardEncodeBase64({line.text.begin(), line.text.end()});
+    } else {
+        kept.value = vcardEscape(line.text);
     }
-    if (!good) reject(line.number, reason);
-    return good;
+    card.lines.push_back(std::move(kept));
+    card.notices.push_back({line.number, reason});
+    std::string text = line.text;
+    if (vcardFirstInvalidUTF8(text) && !convertByFallback(text)) return;
+    std::erase_if(text, [](char c) { return vcardHasControlCharacter(std::string_view(&c, 1)); });
+    auto usable = vcardParseDamagedLine(text);
+    if (!usable || !isOfPerson(usable->name)) return;
+    usable->number = line.number;
+    std::string second;
+    if (decodeLine(*usable, second) && !vcardTrim(usable->value).empty()) card.lines.push_back(std::move(*usable));
+}
+
+bool VCardScanner::convertByFallback(std::string& text) {
+    auto converted = _fallback.empty() ? std::nullopt : vcardConvertToUTF8(text, _fallback);
+    if (!converted) return false;
+    text = std::move(*converted);
+    _fallbackLines++;
+    return true;
 }
 
 bool VCardScanner::setVersion(VCard& card, const VCardLine& line, std::string& reason) const {
@@ -306,7 +343,7 @@ bool VCardScanner::setVersion(VCard& card, const VCardLine& line, std::string& r
 }
 
 // Resolves quoted-printable and CHARSET, and makes sure of the characters.
-bool VCardScanner::decodeLine(VCardLine& line, std::string& reason) const {
+bool VCardScanner::decodeLine(VCardLine& line, std::string& reason) {
     std::string charset;
     bool decoded = false;
     std::erase_if(line.parameters, [&](const VCardParameter& p) {
@@ -329,6 +366,8 @@ bool VCardScanner::decodeLine(VCardLine& line, std::string& reason) const {
         }
         line.value = std::move(*converted);
         decoded = true;
+    } else if (vcardFirstInvalidUTF8(line.value)) {
+        convertByFallback(line.value);
     }
     // A decoded line end is text; in the value of a content line it is written as an escape.
     if (decoded && line.value.find_first_of("\r\n") != std::string::npos) line.value = withEscapedLineEnds(line.value);

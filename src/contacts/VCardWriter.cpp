@@ -3,6 +3,7 @@
 #include "contacts/CXMultiValue.h"
 #include "contacts/Constants.h"
 #include "contacts/VCardFields.h"
+#include "contacts/VCardKept.h"
 #include "contacts/VCardLabels.h"
 #include "contacts/VCardText.h"
 #include "foundation/PropertyList.h"
@@ -77,11 +78,19 @@ private:
             writeGroup();
         else
             writePerson();
-        for (const auto& line : _plain)
-            if (_wrapped.count(line.name))
-                emit("X-ROLVANE-KEPT", vcardEscape(vcardFormatLine(line)));
+        for (const auto& line : _plain) {
+            auto written = _wrapped.count(line.name) ? std::nullopt : formOf(line);
+            if (written)
+                emit(std::move(*written));
             else
-                emit(line);
+                emit("X-ROLVANE-KEPT", vcardEscape(vcardFormatLine(line)));
+        }
+    }
+
+    // Nothing for a line that this version does not have.
+    std::optional<VCardLine> formOf(const VCardLine& kept) const {
+        if (kept.name == "UID" || kept.name.starts_with("X-")) return kept;
+        return vcardKeptLineFor(kept, _v4);
     }
 
     void readBack() {
@@ -131,7 +140,14 @@ private:
                 if (line->name == "UID" && (line->isStillEncoded() || std::exchange(_uidKept, true))) continue;
                 if (vcardIsLabelLine(*line)) _labelledBesides.insert(line->group);
                 if (line->isStillEncoded()) _wrapped.insert(line->name);
-                _plain.push_back(std::move(*line));
+                auto kept = vcardKeptForm(*line); // earlier versions kept lines as they came
+                if (!kept) {
+                    VCardLine unread;
+                    unread.name = kVCardUnreadLine;
+                    unread.value = vcardEscape(vcardFormatLine(*line));
+                    kept = std::move(unread);
+                }
+                _plain.push_back(std::move(*kept));
                 continue;
             }
             std::string label = line->firstValueOf("X-ROLVANE-LABEL");
@@ -200,6 +216,10 @@ private:
     static void take(const Carrier& carrier, VCardLine& line) {
         line.group = carrier.line.group;
         line.parameters = carrier.line.parameters;
+        if (line.parameter("X-ROLVANE-RAW")) {
+            line.value = line.firstValueOf("X-ROLVANE-RAW");
+            std::erase_if(line.parameters, [](const VCardParameter& p) { return p.name == "X-ROLVANE-RAW"; });
+        }
         const VCardParameter* rest = line.parameter("X-ROLVANE-REST");
         if (!rest) return;
         line.value += ';' + line.firstValueOf("X-ROLVANE-REST");
@@ -275,10 +295,15 @@ private:
 
     void writeBirthday() {
         VCardLine line = single("BDAY");
-        if (auto date = _p[kCXBirthdayProperty].date())
+        if (auto date = _p[kCXBirthdayProperty].date()) {
             line.value = vcardEncodeDate(*date, _v4);
-        else if (!_v4 || !vcardIsTruncatedDate(line.value))
+            // Where the year is a filling, 4.0 leaves it out.
+            const int filling = vcardOmittedYear(line);
+            const bool omitted = _v4 && filling > 0 && line.value.size() == 8;
+            if (omitted && std::atoi(line.value.substr(0, 4).c_str()) == filling) line.value.replace(0, 4, "--");
+        } else if (!vcardIsTruncatedDate(line.value)) {
             line.add("VALUE", "text");
+        }
         if (!line.value.empty()) emit(std::move(line));
     }
 
@@ -317,16 +342,16 @@ private:
             take(*carrier, line);
         } else {
             for (auto& t : vcardTypesForLabel(field.lineName, entry.label)) line.add("TYPE", t);
-            if (field.lineName == std::string_view("EMAIL") && !_v4) line.add("TYPE", "internet");
         }
         placePreference(line, preference);
         if (field.property == std::string_view(kCXAddressProperty)) {
             std::string code = entry.value.dictionary()[kCXAddressCountryCodeKey].string();
             if (!code.empty()) line.add("CC", code);
         }
-        nameFor(line, field, entry.label);
+        nameFor(line, field, entry);
         bool saidByName = line.name.ends_with("ANNIVERSARY");
-        bool saidByTypes = vcardLabelForTypes(field.lineName, line.types()) == entry.label;
+        bool needsLabel = line.name.starts_with("X-AB") && !entry.label.empty();
+        bool saidByTypes = !needsLabel && vcardLabelForTypes(field.lineName, line.types()) == entry.label;
         bool related = line.name == "RELATED";
         if (related) line.parameters.insert(line.parameters.begin(), {"VALUE", {"text"}});
         // Another label of the group must not be taken for this one.
@@ -336,16 +361,26 @@ private:
         if (!_labelled.insert(line.group).second) return emit(std::move(line));
         VCardLine label;
         label.group = line.group;
-        label.name = "X-ROLVANE-LABEL";
-        label.value = vcardEscape(entry.label);
+        const auto text = vcardTextForLabel(entry.label);
+        label.name = text ? "X-ABLabel" : "X-ROLVANE-LABEL"; // spelt as programs do that mind the case
+        label.value = vcardEscape(text ? *text : entry.label);
         emit(std::move(line));
         emit(std::move(label));
     }
 
-    void nameFor(VCardLine& line, const VCardMultiField& field, const std::string& label) {
-        bool anniversary = field.property == std::string_view(kCXOtherDatesProperty) && label == kCXAnniversaryLabel;
-        if (anniversary) {
-            line.name = _v4 && !std::exchange(_anniversary, true) ? "ANNIVERSARY" : "X-ANNIVERSARY";
+    // Dates and relations that a version has no property for are written as address books of telephones do.
+    void nameFor(VCardLine& line, const VCardMultiField& field, const CXMultiValue::Entry& entry) {
+        const bool isDate = field.property == std::string_view(kCXOtherDatesProperty);
+        const bool together = !line.group.empty(); // with lines that a label would name, too
+        if (isDate && _v4 && entry.label == kCXAnniversaryLabel && !std::exchange(_anniversary, true)) {
+            line.name = "ANNIVERSARY";
+        } else if (isDate && together && entry.label == kCXAnniversaryLabel) {
+            line.name = "X-ANNIVERSARY";
+        } else if (isDate) {
+            line.name = "X-ABDATE";
+            line.value = vcardEncodeDate(*entry.value.date(), false);
+        } else if (!_v4 && !together && line.name == "RELATED" && vcardTextForLabel(entry.label)) {
+            line.name = "X-ABRELATEDNAMES";
         } else if (_v4 ? !field.inVersion4 : !field.inVersion3) {
             line.name = std::string("X-ROLVANE-") + field.lineName;
         }

@@ -203,5 +203,94 @@ TEST_F(Contacts, DefaultsAreWrittenReadAndDeleted) {
     EXPECT_EQ(world.json({"defaults", "read", "--domain", "net.example.other"}), (nlohmann::json{{"Key", "value"}}));
 }
 
+// The program under a terminal of its own, of so many columns; what it wrote there.
+std::string onTerminal(CommandWorld& world, int columns, const std::string& command) {
+    const Ran ran = world.run({"script", "-qec", "stty cols " + std::to_string(columns) + "; " + command, "/dev/null"});
+    EXPECT_EQ(ran.status, 0) << ran;
+    return ran.output;
+}
+
+TEST_F(Contacts, AListOfANarrowTerminalHasTheNameFirstThenANumberAndNoIdentifiers) {
+    const std::string uid =
+        world.add("Ada", {"--last", "Miller", "--phone", "mobile:+1 555 0100", "--email", "x:a@b.test"});
+    world.add("Bob", {"--last", "Bartholomew-Featherstonehaugh", "--email", "home:bob@b.test"});
+    const std::string out = onTerminal(world, 40, UserWorld::rolvaneProgram() + " list");
+    EXPECT_TRUE(out.starts_with("Bob Bartholomew-Fe…")) << out;
+    EXPECT_NE(out.find("bob@b.test"), std::string::npos) << out;
+    EXPECT_NE(out.find("Ada Miller            +1 555 0100"), std::string::npos) << out;
+    EXPECT_EQ(out.find(uid), std::string::npos);
+    EXPECT_NE(world.done({"list", "--full"}).find(uid), std::string::npos);
+}
+
+TEST_F(Contacts, NothingInANameSteersATerminal) {
+    const std::string evil = "\xE2\x80\xAE"
+                             "evil\x1B]0;t\x07\xC2\x9B"
+                             "31m";
+    world.add(evil, {"--last", "Miller", "--note", evil, "--org", evil, "--phone", "x:1"});
+    world.add(evil + "2", {"--last", "Miller"});
+    world.group(evil);
+    world.done({"group", "add", evil,
+                "evil\x1B]0;t\x07\xC2\x9B"
+                "31m2"});
+    const std::vector<std::vector<std::string>> commands{{"list"},
+                                                         {"list", "--full"},
+                                                         {"list", "--json"},
+                                                         {"list", "--json", "--full"},
+                                                         {"show", "Miller"},
+                                                         {"duplicates"},
+                                                         {"group", "list"},
+                                                         {"group", "show", "evil"},
+                                                         {"group", "list", "--json"},
+                                                         {"delete", "Miller"}};
+    size_t printed = 0;
+    for (const auto& command : commands) {
+        const Ran ran = world.rolvane(command);
+        for (const std::string& text : {ran.output, ran.errors}) {
+            printed += text.find("u202e") != std::string::npos ? 1 : 0;
+            for (const char* raw : {"\x1B", "\x07", "\xE2\x80\xAE", "\xC2\x9B"})
+                EXPECT_EQ(text.find(raw), std::string::npos) << command.front() << ": " << text;
+        }
+    }
+    EXPECT_GE(printed, 7U) << "the names are shown, with escapes";
+    EXPECT_EQ(world.json({"list", "--full"})[0]["properties"]["Note"], evil) << "and they say the same";
+}
+
+TEST_F(Contacts, AListWithEverythingHasForEachWhatShowHas) {
+    world.add("Ada", {"--last", "O\"Mill\\er", "--phone", "mobile:+1 555 0100", "--birthday", "1980-12-31"});
+    world.add("Émile", {"--note", "two\nlines"});
+    world.group("Family", {"Ada"});
+    const auto all = world.json({"list", "--full"});
+    ASSERT_EQ(all.size(), 2U);
+    for (const auto& each : all) EXPECT_EQ(each, world.json({"show", each["identifier"].get<std::string>()}));
+}
+
+TEST_F(Contacts, ABirthdayWithoutItsYearIsShownAsADay) {
+    world.done({"import", "-q", "-"}, "BEGIN:VCARD\r\nVERSION:4.0\r\nFN:Ada\r\nBDAY:--0517\r\nEND:VCARD\r\n");
+    EXPECT_NE(world.done({"show", "Ada"}).find("17 May"), std::string::npos);
+}
+
+TEST_F(Contacts, PeopleWhoAreOneAreListedAndJoinedAndATrialJoinsNobody) {
+    const std::string one = world.add("Ada", {"--email", "home:ada@b.test", "--title", "Cook"});
+    const std::string two = world.add("Ada", {"--email", "work:ada@b.test", "--title", "Baker"});
+    const auto alike = world.json({"duplicates"});
+    ASSERT_EQ(alike.size(), 1U);
+    EXPECT_EQ(alike[0]["alike"], "same");
+    EXPECT_EQ(world.json({"merge", "Ada", "--dry-run"}).size(), 1U);
+    EXPECT_EQ(world.json({"list"}).size(), 2U);
+    const auto told = world.json({"merge", one, two});
+    EXPECT_EQ(told[0]["gaveWay"][0], "JobTitle: Baker");
+    const auto left = world.json({"list", "--full"});
+    ASSERT_EQ(left.size(), 1U);
+    EXPECT_EQ(left[0]["identifier"], one);
+    EXPECT_EQ(left[0]["properties"]["Note"], "JobTitle: Baker");
+    EXPECT_EQ(world.json({"duplicates"}).size(), 0U);
+    EXPECT_TRUE(saysOnce(world.rolvane({"merge", "Ada"}), kNoSuchThing, "no two people"));
+    EXPECT_TRUE(saysOnce(world.rolvane({"merge"}), kWrongLine, "--alike"));
+}
+
+TEST_F(Contacts, ACharacterSetThatIsNoneIsRefused) {
+    EXPECT_TRUE(saysOnce(world.rolvane({"import", "--charset", "KLINGON", "-"}), kWrongLine, "KLINGON"));
+}
+
 } // namespace
 } // namespace rolvane::test

@@ -28,11 +28,11 @@ std::string reasonOf(const std::function<void()>& work) {
 TEST(DatabaseFault, AFileOfANewerFormatIsRefusedAndLeftAlone) {
     TestDatabase d;
     d.database.reset();
-    Sqlite(d.path, 0).execute("PRAGMA user_version=5");
+    Sqlite(d.path, 0).execute("PRAGMA user_version=6");
     std::string told = reasonOf([&] { d.open(); });
     EXPECT_TELLS(told, "newer version");
     EXPECT_TELLS(told, d.path);
-    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 5);
+    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 6);
 }
 
 TEST(DatabaseFault, AFileOfTheFormerFormatLearnsWhoWroteWhat) {
@@ -48,7 +48,7 @@ TEST(DatabaseFault, AFileOfTheFormerFormatLearnsWhoWroteWhat) {
     d->save();
     EXPECT_EQ(d->personRow(UniqueId("A:CXPerson"))->writer, "rolvane");
     d.database.reset();
-    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 4);
+    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 5);
 }
 
 TEST(DatabaseFault, AFileOfTheFormatBeforeNamesItsGroupsMembers) {
@@ -63,7 +63,7 @@ TEST(DatabaseFault, AFileOfTheFormatBeforeNamesItsGroupsMembers) {
     EXPECT_EQ(friends->memberUniqueIds(), std::vector{UniqueId("A:CXPerson")});
     EXPECT_EQ(friends->memberCount(), 1u);
     d.database.reset();
-    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 4);
+    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 5);
 }
 
 TEST(DatabaseFault, AFileOfTheFormatBeforeKeepsWhatEditedContactsWere) {
@@ -81,7 +81,30 @@ TEST(DatabaseFault, AFileOfTheFormatBeforeKeepsWhatEditedContactsWere) {
     d->save();
     EXPECT_EQ(d->editedSinceCommon(), std::vector{ada});
     d.database.reset();
-    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 4);
+    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 5);
+}
+
+TEST(DatabaseFault, AFileOfTheFormatBeforeFindsPeopleByTheirNames) {
+    TestDatabase d;
+    d.addPerson("Ada", "A:CXPerson");
+    d->save();
+    d.database.reset();
+    Sqlite(d.path, 0).execute("DROP INDEX records_display; PRAGMA user_version=4");
+    d.database = d.open("rolvane");
+    for (const auto& [named, how] :
+         std::vector<std::pair<std::string, CXRolvane::Named>>{{"ADA", CXRolvane::Named::whole},
+                                                               {"d", CXRolvane::Named::part},
+                                                               {"a:cx", CXRolvane::Named::byIdentifier}}) {
+        const auto found = d->peopleNamed(named, how);
+        ASSERT_EQ(found.size(), 1u) << named;
+        EXPECT_EQ(found[0].uniqueId.str(), "A:CXPerson");
+        EXPECT_EQ(found[0].displayName, "Ada");
+        d.addPerson("Bob"); // what is not saved is found, too
+        EXPECT_EQ(d->peopleNamed("bob", CXRolvane::Named::whole).size(), 1u);
+        d->rollback();
+    }
+    d.database.reset();
+    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 5);
 }
 
 TEST(DatabaseFault, AnotherProgramsFileIsRefusedAndLeftAlone) {

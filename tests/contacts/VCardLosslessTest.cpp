@@ -98,9 +98,9 @@ TEST(VCardLossless, OneLabelServesAllLinesOfItsGroup) {
     auto e = readOne("FN:x\r\nitem1.TEL:1\r\nitem1.TEL:2\r\nitem1.X-ABLABEL:Cabin\r\n");
     for (auto version : {VCardVersion::v3, VCardVersion::v4}) {
         std::string text = vcardText(e, version);
-        size_t at = text.find("item1.X-ROLVANE-LABEL:Cabin\r\n");
+        size_t at = text.find("item1.X-ABLabel:Cabin\r\n");
         ASSERT_NE(at, std::string::npos) << text;
-        EXPECT_EQ(text.find("X-ROLVANE-LABEL", at + 10), std::string::npos) << text;
+        EXPECT_EQ(text.find("LABEL", at + 15), std::string::npos) << text;
     }
     expectComesBack(e);
 }
@@ -125,7 +125,7 @@ TEST(VCardLossless, ParametersOfATextByAForeignNameAreWrittenUnderOurs) {
 TEST(VCardLossless, ParametersOfABirthdayAreKept) {
     auto full = readOne("FN:x\r\nBDAY;VALUE=date;X-OMIT-YEAR=1604:1604-04-12\r\n", "3.0");
     EXPECT_NE(vcardText(full, VCardVersion::v3).find("BDAY;X-OMIT-YEAR=1604:1604-04-12\r\n"), std::string::npos);
-    EXPECT_NE(vcardText(full, VCardVersion::v4).find("BDAY;X-OMIT-YEAR=1604:16040412\r\n"), std::string::npos);
+    EXPECT_NE(vcardText(full, VCardVersion::v4).find("BDAY;X-OMIT-YEAR=1604:--0412\r\n"), std::string::npos);
     expectComesBack(full);
     auto text = readOne("FN:x\r\nBDAY;VALUE=text;LANGUAGE=fr:vers 1800\r\n");
     EXPECT_TRUE(bothVersionsContain(text, "BDAY;LANGUAGE=fr;VALUE=text:vers 1800\r\n"));
@@ -205,8 +205,9 @@ TEST(VCardLossless, AKeptLineIsNotTakenForAPropertyThatThePersonRemoved) {
 
 TEST(VCardLossless, AKeptLineNeverMakesAPersonAGroup) {
     VCardEntity e;
-    e.properties = {{kCXFirstNameProperty, "Ann"},
-                    {kCXVCardExtraProperty, Array{"CATEGORIES:Work", "KIND:group", "PHOTO;ENCODING=b:!!"}}};
+    e.properties = {
+        {kCXFirstNameProperty, "Ann"},
+        {kCXVCardExtraProperty, Array{"CATEGORIES:Work", "KIND:group", "X-ROLVANE-UNREAD:PHOTO\\;ENCODING=b:!!"}}};
     expectComesBack(e);
 }
 
