@@ -215,7 +215,7 @@ TEST_F(Contacts, AListOfANarrowTerminalHasTheNameFirstThenANumberAndNoIdentifier
         world.add("Ada", {"--last", "Miller", "--phone", "mobile:+1 555 0100", "--email", "x:a@b.test"});
     world.add("Bob", {"--last", "Bartholomew-Featherstonehaugh", "--email", "home:bob@b.test"});
     const std::string out = onTerminal(world, 40, UserWorld::rolvaneProgram() + " list");
-    EXPECT_TRUE(out.starts_with("Bob Bartholomew-Fe…")) << out;
+    EXPECT_TRUE(out.starts_with("Bob Bartholomew-Fea…  bob@b.test")) << out;
     EXPECT_NE(out.find("bob@b.test"), std::string::npos) << out;
     EXPECT_NE(out.find("Ada Miller            +1 555 0100"), std::string::npos) << out;
     EXPECT_EQ(out.find(uid), std::string::npos);
@@ -229,9 +229,6 @@ TEST_F(Contacts, NothingInANameSteersATerminal) {
     world.add(evil, {"--last", "Miller", "--note", evil, "--org", evil, "--phone", "x:1"});
     world.add(evil + "2", {"--last", "Miller"});
     world.group(evil);
-    world.done({"group", "add", evil,
-                "evil\x1B]0;t\x07\xC2\x9B"
-                "31m2"});
     const std::vector<std::vector<std::string>> commands{{"list"},
                                                          {"list", "--full"},
                                                          {"list", "--json"},
@@ -252,7 +249,10 @@ TEST_F(Contacts, NothingInANameSteersATerminal) {
         }
     }
     EXPECT_GE(printed, 7U) << "the names are shown, with escapes";
-    EXPECT_EQ(world.json({"list", "--full"})[0]["properties"]["Note"], evil) << "and they say the same";
+    // The database takes no control characters of the lowest kind; what it has taken is in the document.
+    EXPECT_EQ(world.json({"list", "--full"})[0]["properties"]["Note"], "\xE2\x80\xAE"
+                                                                       "evil]0;t\xC2\x9B"
+                                                                       "31m");
 }
 
 TEST_F(Contacts, AListWithEverythingHasForEachWhatShowHas) {
