@@ -66,6 +66,7 @@ bench:
 	cmake --preset bench
 	cmake --build --preset bench -j$(JOBS)
 	bench/run build/bench
+	bench/longlist.py build/bench
 
 lint:
 	@packaging/setup build test lint
