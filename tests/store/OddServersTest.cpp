@@ -86,7 +86,9 @@ void servesAPublication(const Oddities& habits) {
         EXPECT_FALSE(isNew(group));
     }
     EXPECT_EQ(alice.write("People/4/A%3ACXPerson", Dictionary{{"a", 3}}), 204) << alice.wire->text();
-    if (habits.tags || !habits.dates) EXPECT_TRUE(isNew(person)) << "another version is not";
+    if (habits.tags || !habits.dates) {
+        EXPECT_TRUE(isNew(person)) << "another version is not";
+    }
     EXPECT_TRUE(alice.manager->removeFileAtURL(alice.at("People/4/A%3ACXPerson"), nullptr)) << alice.wire->text();
     EXPECT_TRUE(alice.manager->removeFileAtURL(alice.at("G%3ACXGroup"), nullptr)) << alice.wire->text();
     EXPECT_FALSE(isNew(person));
@@ -146,7 +148,7 @@ INSTANTIATE_TEST_SUITE_P(
                  o.namesItself = o.statuses = false, o.multistatus = 200, o.hrefOrigin = "http://backend:1";
                  o.encoding = "gzip", o.ifWithTag = 412, o.ifNoneMatch = 501, o.lockGranted = 201, o.deleted = 207;
              })),
-    [](const auto& info) { return std::string(info.param.name); });
+    [](const auto& each) { return std::string(each.param.name); });
 
 // What a server gets wrong of conditions must not become a write over somebody else's version.
 TEST(OddServer, ThatGetsConditionsWrongLosesNobodysVersion) {
@@ -257,7 +259,9 @@ TEST(OddServer, WhoCouldNotDeleteAllIsNotBelievedToHaveDoneSo) {
 StoreTrial trialOf(const Oddities& habits, bool isPublished = false) {
     OddServer server(habits);
     OddClient alice(server);
-    if (isPublished) EXPECT_TRUE(alice.manager->sanityCheckPublishStructureCreate(true));
+    if (isPublished) {
+        EXPECT_TRUE(alice.manager->sanityCheckPublishStructureCreate(true));
+    }
     const auto files = server.files();
     const auto collections = server.collections();
     CXDAVError error;
