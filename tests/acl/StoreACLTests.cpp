@@ -158,11 +158,17 @@ TEST_F(SubscribersRights, AreUnknownWhenTheAnswerIsMalformed) {
     EXPECT_TRUE(loadsNothing(answerOf(207, {}, "<D:other xmlns:D=\"DAV:\">" + good + "</D:other>")));
     EXPECT_TRUE(loadsNothing(answerOf(207, {}, "<multistatus>" + good + "</multistatus>")));
     EXPECT_TRUE(loadsNothing(answerOf(207, {}, "not XML")));
-    for (const int status : {200, 401, 403, 404, 500})
+    for (const int status : {401, 403, 404, 500})
         EXPECT_TRUE(loadsNothing(answerOf(status, {}, AclStore::multistatus(good).body))) << status;
+    EXPECT_TRUE(loadsNothing(answerOf(200, {}, "<html/>")));
     const std::string whole = AclStore::multistatus(good).body;
     for (size_t n = 0; n + 2 < whole.size(); n += 5)
         EXPECT_TRUE(loadsNothing(answerOf(207, {}, whole.substr(0, n)))) << n;
+}
+
+TEST_F(SubscribersRights, AreReadOfAServerThatSays200WithTheSameDocument) {
+    const std::string good = AclStore::response(kEntry, privileges({"write"}));
+    EXPECT_EQ(writersAfter(answerOf(200, {}, AclStore::multistatus(good).body)), Users{kSelf});
 }
 
 TEST_F(SubscribersRights, AnAnswerWithTwoMultistatusElementsIsRejected) {

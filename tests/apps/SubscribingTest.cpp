@@ -3,6 +3,7 @@
 #include <filesystem>
 #include <functional>
 #include <map>
+#include <regex>
 
 namespace rolvane::test {
 namespace {
@@ -67,7 +68,8 @@ TEST_F(Subscribing, SubscribeReturnsWhenThePeopleAreHere) {
     EXPECT_EQ(groups[0]["owner"], "alice");
     EXPECT_EQ(groups[0]["members"].size(), 1U);
     EXPECT_NE(bob.done({"show", "Ada Miller"}).find("alice, at " + location + " (read only)"), std::string::npos);
-    EXPECT_NE(bob.done({"list"}).find("Bea  [alice]"), std::string::npos);
+    EXPECT_NE(bob.done({"list", "--full"}).find("Bea  [alice]"), std::string::npos);
+    EXPECT_TRUE(std::regex_search(bob.done({"list"}), std::regex("Bea +\\[alice\\]\n")));
     const auto status = bob.json({"status"});
     EXPECT_EQ(status["pending"], 0);
     ASSERT_EQ(status["subscriptions"].size(), 1U);
