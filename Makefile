@@ -58,7 +58,7 @@ SECONDS_EACH ?= 60
 fuzz:
 	@packaging/setup build fuzz
 	cmake --preset fuzz
-	cmake --build --preset fuzz -j$(JOBS)
+	cmake --build --preset fuzz --target fuzz_targets -j$(JOBS)
 	fuzz/run build/fuzz $(SECONDS_EACH)
 
 bench:
