@@ -44,7 +44,9 @@ XmlSax::XmlSax(int maxDepth) : _maxDepth(static_cast<size_t>(maxDepth)) {
     xmlCtxtUseOptions(_context, XML_PARSE_NONET | XML_PARSE_NOERROR | XML_PARSE_NOWARNING);
 }
 
+// Where entities are declared the parser makes a document of its own for them, which a push parser leaves to its user.
 XmlSax::~XmlSax() {
+    if (_context->myDoc) xmlFreeDoc(_context->myDoc);
     xmlFreeParserCtxt(_context);
 }
 
