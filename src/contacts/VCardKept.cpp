@@ -131,9 +131,10 @@ bool makeMediaUniform(VCardLine& line, const Media& media) {
     const std::string value = vcardLower(line.firstValueOf("VALUE"));
     if (value == "inline" || value == "binary" || value == "url" || value == "uri") remove(line, "VALUE");
     if (value == "text" || line.value.empty()) return true;
+    if (line.parameter("VALUE")) return true; // of a type of its own
     if (isURI(line.value))
         line.parameters.insert(line.parameters.begin(), {"VALUE", {"uri"}});
-    else if (line.name == "KEY" && !line.parameter("VALUE"))
+    else if (line.name == "KEY")
         line.parameters.insert(line.parameters.begin(), {"VALUE", {"text"}});
     return true;
 }
