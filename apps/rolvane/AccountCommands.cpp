@@ -149,7 +149,7 @@ void showAccount(Context& context) {
     if (account->plainLoopback) context.line(fmt::format("{:<15}{}", "Transport", "plain http on this machine"));
 }
 
-// What follows from what a store that can be used lacks.
+// Sentences for a usable store: each names an ability that it lacks, and the consequence.
 std::vector<std::string> consequences(const StoreTrial& trial) {
     std::vector<std::string> lines;
     if (!trial.locks && trial.conditions)

@@ -35,7 +35,7 @@ private:
 };
 
 // What every command gets: where output goes, and the things that it works on, opened on first use.
-// Whatever is printed by these functions has nothing in it that steers a terminal (SafeText.h).
+// These functions print names and texts without control characters, so that no text steers a terminal (SafeText.h).
 // Data goes to standard output (a table for people, one JSON document with --json); talk goes to standard error.
 class Context {
 public:

@@ -58,7 +58,7 @@ UniqueId only(const std::vector<CXListing>& found, const std::string& kind, cons
 
 } // namespace
 
-// The same rules for people, of whom there may be many: each rule asks an index.
+// The same rules for people. Each rule asks an index, because an address book may hold many people.
 std::vector<CXListing> peopleMatching(CXRolvane& database, const std::string& named, bool whole) {
     const bool mayBeIdentifier = named.size() >= kIdentifierStart;
     std::vector<CXListing> begun;

@@ -5,8 +5,8 @@
 
 namespace rolvane::cli {
 
-// Texts of other people on their way to a terminal: what would steer it, or turn the direction of what stands behind,
-// is shown as an escape, "\u202e". Bytes that are no UTF-8 become U+FFFD. Pure functions.
+// Make other people's texts safe for a terminal. Characters that steer it or turn the direction of writing are shown as
+// escapes, "\u202e". Bytes that are no UTF-8 become U+FFFD. Pure functions.
 
 std::string shownText(std::string_view text); // line feeds and tabs stay
 std::string shownLine(std::string_view text); // for a text within a line: those too are escapes

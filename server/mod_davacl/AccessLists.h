@@ -65,7 +65,8 @@ public:
     };
     using Granted = std::map<std::string, Rights, std::less<>>;
     Granted grantedTo(const Caller& caller) const;
-    // What the lists of the places on the way down to the tree grant, together: of two that disagree the nearer counts.
+    // The privileges that all lists on the way down to the tree grant together. Of two lists that disagree the nearer
+    // one counts.
     static unsigned together(const Granted& granted, const std::vector<std::string>& segments);
     unsigned granted(const Caller& caller, const std::vector<std::string>& segments) const {
         return together(grantedTo(caller), segments);

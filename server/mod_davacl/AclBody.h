@@ -18,7 +18,7 @@ struct Unmet {
     std::string words;
 };
 
-// What a body is read against.
+// The place whose list the body sets, and the names that the body may use there.
 struct AclPlace {
     std::string owner;
     std::vector<std::string> above; // the escaped URL paths of the places above that may have lists

@@ -121,7 +121,7 @@ int serve(request_rec* r) {
     }
     removeForeignFilters(r);
     r->handler = handlerFor(r);
-    // Whoever writes in a tree is not who runs the site: no page of theirs is part of it.
+    // A writer of a tree does not run the site, so a browser treats an uploaded page as foreign to it.
     apr_table_setn(r->headers_out, "Content-Security-Policy", "sandbox; default-src 'none'");
     apr_table_setn(r->headers_out, "X-Content-Type-Options", "nosniff");
     for (const auto own : {servePrincipals, serveAcl, prepareChange})

@@ -4,8 +4,8 @@
 
 namespace rolvane::davacl {
 
-// What lies below the base and the principals is answered by mod_dav, this module and httpd's own sending of files, and
-// by nobody else, whatever the rest of the configuration says.
+// Below the base and the principals only mod_dav, this module and httpd's own sending of files answer. Other handlers
+// stay out, whatever the rest of the configuration says.
 
 // Reads the settings that hold there, once for a configuration. Nothing, or a complaint.
 const char* prepareConfinement(apr_pool_t* pool, apr_pool_t* temporary, server_rec* server);

@@ -43,12 +43,7 @@ public:
 
     std::optional<VCardLine> parse() {
         VCardLine line;
-        std::string_view first = name();
-        if (at('.')) {
-            _i++;
-            line.group = std::string(first);
-            first = name();
-        }
+        const std::string_view first = groupAndName(line);
         if (first.empty()) return fail("the line does not begin with a property name");
         line.name = vcardUpper(first);
         while (at(';')) {
@@ -63,12 +58,7 @@ public:
     // Parameters that cannot be read are passed over.
     std::optional<VCardLine> parseDamaged() {
         VCardLine line;
-        std::string_view first = name();
-        if (at('.')) {
-            _i++;
-            line.group = std::string(first);
-            first = name();
-        }
+        const std::string_view first = groupAndName(line);
         line.name = vcardUpper(first);
         while (!first.empty() && at(';')) {
             const size_t start = ++_i;
@@ -116,6 +106,15 @@ private:
     std::nullopt_t fail(const char* why) {
         reason = why;
         return std::nullopt;
+    }
+
+    // Takes the group, where there is one, into the line; the property's name.
+    std::string_view groupAndName(VCardLine& line) {
+        const std::string_view first = name();
+        if (!at('.')) return first;
+        _i++;
+        line.group = std::string(first);
+        return name();
     }
 
     std::string_view name() {

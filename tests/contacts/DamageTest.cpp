@@ -12,18 +12,6 @@
 namespace rolvane::test {
 namespace {
 
-std::string reasonOf(const std::function<void()>& work) {
-    try {
-        work();
-    } catch (const CXException& e) {
-        EXPECT_EQ(e.name(), kCXDatabaseException);
-        return e.reason();
-    }
-    return "";
-}
-
-#define EXPECT_TELLS(text, part) EXPECT_NE((text).find(part), std::string::npos) << (text)
-
 // Ada, Ben, Cleo and Dora; Ada and Cleo are friends.
 struct DamagedDatabase : TestDatabase {
     DamagedDatabase() {

@@ -12,19 +12,6 @@
 namespace rolvane::test {
 namespace {
 
-// The reason of the exception that the work throws; "" when it throws none.
-std::string reasonOf(const std::function<void()>& work) {
-    try {
-        work();
-    } catch (const CXException& e) {
-        EXPECT_EQ(e.name(), kCXDatabaseException);
-        return e.reason();
-    }
-    return "";
-}
-
-#define EXPECT_TELLS(text, part) EXPECT_NE((text).find(part), std::string::npos) << (text)
-
 TEST(DatabaseFault, AFileOfANewerFormatIsRefusedAndLeftAlone) {
     TestDatabase d;
     d.database.reset();

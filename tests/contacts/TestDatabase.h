@@ -100,4 +100,17 @@ inline std::vector<std::string> names(const std::vector<CXPersonRef>& people) {
     return all;
 }
 
+// The reason of the database's exception that the work throws; "" when it throws none.
+inline std::string reasonOf(const std::function<void()>& work) {
+    try {
+        work();
+    } catch (const CXException& e) {
+        EXPECT_EQ(e.name(), kCXDatabaseException);
+        return e.reason();
+    }
+    return "";
+}
+
+#define EXPECT_TELLS(text, part) EXPECT_NE((text).find(part), std::string::npos) << (text)
+
 } // namespace rolvane::test

@@ -1,6 +1,7 @@
 // Cards as other programs write them: what they say is read, and nothing of it gets lost between import and export.
 
 #include "TestDatabase.h"
+#include "VCardFiles.h"
 #include "VCardGenerators.h"
 
 #include "contacts/TextCharset.h"
@@ -16,27 +17,12 @@ namespace rolvane {
 namespace {
 
 using test::TestDatabase;
+using vcardtest::card;
+using vcardtest::exportAll;
+using vcardtest::importText;
 using vcardtest::readOneCard;
 using vcardtest::readText;
 using vcardtest::withoutIdentifiers;
-
-VCardImportReport importText(CXRolvane& database, const std::string& text, const std::string& charset = {}) {
-    VCardImport import(database);
-    import.setCharset(charset);
-    std::istringstream in(text);
-    import.addStream(in, "text.vcf", text.size());
-    return import.finish();
-}
-
-std::string exportAll(CXRolvane& database, VCardVersion version) {
-    std::ostringstream out;
-    VCardExport(database, out, version).exportAll();
-    return out.str();
-}
-
-std::string card(const std::string& lines, const std::string& version = "3.0") {
-    return "BEGIN:VCARD\r\nVERSION:" + version + "\r\n" + lines + "END:VCARD\r\n";
-}
 
 bool contains(const std::string& text, const std::string& part) {
     return text.find(part) != std::string::npos;

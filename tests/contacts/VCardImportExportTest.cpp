@@ -1,4 +1,5 @@
 #include "TestDatabase.h"
+#include "VCardFiles.h"
 #include "VCardGenerators.h"
 
 #include "contacts/VCardExport.h"
@@ -17,26 +18,12 @@ namespace rolvane {
 namespace {
 
 using test::TestDatabase;
+using vcardtest::card;
+using vcardtest::exportAll;
+using vcardtest::importText;
 using vcardtest::withoutIdentifiers;
 
 const std::string kDemo = ROLVANE_SOURCE_DIR "/share/demo/";
-
-VCardImportReport importText(CXRolvane& database, const std::string& text) {
-    VCardImport import(database);
-    std::istringstream in(text);
-    import.addStream(in, "text.vcf", text.size());
-    return import.finish();
-}
-
-std::string exportAll(CXRolvane& database, VCardVersion version) {
-    std::ostringstream out;
-    VCardExport(database, out, version).exportAll();
-    return out.str();
-}
-
-std::string card(const std::string& lines, const std::string& version = "3.0") {
-    return "BEGIN:VCARD\r\nVERSION:" + version + "\r\n" + lines + "END:VCARD\r\n";
-}
 
 std::string uuid(int n) {
     char text[40];
