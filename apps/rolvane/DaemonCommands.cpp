@@ -152,12 +152,14 @@ Json endedJson(const Preferences& preferences, bool publishes) {
 std::string endedText(const Json& ended) {
     std::string users;
     for (const Json& user : ended["mayStillRead"]) users += (users.empty() ? "" : ", ") + user.get<std::string>();
-    return fmt::format(
-        "on {}: {}. `rolvane publish` publishes again.{}", ended["date"].get<std::string>(),
-        ended["why"] == "replaced" ? "another publication of yours lies in its place on the store, made from another "
-                                     "computer perhaps"
-                                   : "the store has nothing of it any more, or does not let you in",
-        users.empty() ? "" : " The store has not taken yet that you took rights away from " + users + ".");
+    return fmt::format("on {}: {}. `rolvane publish` publishes again.{}", ended["date"].get<std::string>(),
+                       ended["why"] == "replaced"
+                           ? "another publication of yours lies in its place on the store, made from another "
+                             "computer perhaps"
+                           : "the store has nothing of it any more, or does not let you in",
+                       users.empty() ? ""
+                                     : " The store does not know yet that you took rights away from " + users +
+                                           ": after `rolvane publish`, `rolvane unshare` takes them away there.");
 }
 
 Json status(Context& context) {

@@ -29,8 +29,9 @@ const std::map<std::string_view, const char*>& builtInTexts() {
         {"SHARING_ENDED_REPLACED",
          "On the store lies another publication of yours, made from another computer perhaps. Your contacts stay as "
          "they are on this computer, and nothing there was changed. \"rolvane publish\" publishes them from here."},
-        {"SHARING_ENDED_RIGHTS", "You have taken rights away from {users}, and the store does not know of it yet: what "
-                                 "is left there may still be read."},
+        {"SHARING_ENDED_RIGHTS", "You have taken rights away from {users}, and the store does not know of it yet: they "
+                                 "may still read what is left there. After \"rolvane publish\", \"rolvane unshare\" "
+                                 "takes the rights away there."},
         {"AND", "and"},
         {"OK", "OK"},
     };
