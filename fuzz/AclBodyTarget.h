@@ -3,8 +3,8 @@
 #include "server/mod_davacl/AclBody.h"
 #include "server/mod_davacl/Privileges.h"
 #include "server/mod_davacl/TreePath.h"
-#include "store/CXACE.h"
-#include "store/CXDAVNode.h"
+#include "store/dav/CXACE.h"
+#include "store/dav/CXDAVNode.h"
 
 #include <cstdint>
 #include <stdexcept>

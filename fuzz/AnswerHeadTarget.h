@@ -2,11 +2,11 @@
 
 #include "foundation/Date.h"
 #include "foundation/Utf8.h"
-#include "store/ExpectedAnswer.h"
-#include "store/HttpTransport.h"
-#include "store/LockAnswers.h"
-#include "store/Multistatus.h"
-#include "store/RequestFailures.h"
+#include "store/dav/Multistatus.h"
+#include "store/http/ExpectedAnswer.h"
+#include "store/http/HttpTransport.h"
+#include "store/http/RequestFailures.h"
+#include "store/locks/LockAnswers.h"
 
 #include <cmath>
 #include <cstdint>

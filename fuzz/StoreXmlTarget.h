@@ -1,8 +1,8 @@
 #pragma once
 
-#include "store/CXACE.h"
-#include "store/CXDAVNode.h"
-#include "store/Multistatus.h"
+#include "store/dav/CXACE.h"
+#include "store/dav/CXDAVNode.h"
+#include "store/dav/Multistatus.h"
 
 #include <algorithm>
 #include <cstdint>

@@ -1,8 +1,8 @@
 #pragma once
 
-#include "contacts/CXMultiValue.h"
-#include "contacts/VCardReader.h"
-#include "contacts/VCardWriter.h"
+#include "contacts/records/CXMultiValue.h"
+#include "contacts/vcard/VCardReader.h"
+#include "contacts/vcard/VCardWriter.h"
 #include "foundation/PropertyList.h"
 
 #include <algorithm>

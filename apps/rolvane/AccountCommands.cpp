@@ -6,8 +6,8 @@
 #include "daemon/RetrySchedule.h"
 #include "foundation/Paths.h"
 #include "foundation/Preferences.h"
-#include "store/CXDAVManager.h"
-#include "store/StoreTrial.h"
+#include "store/account/StoreTrial.h"
+#include "store/dav/CXDAVManager.h"
 
 #include <filesystem>
 #include <fmt/format.h>

@@ -2,7 +2,7 @@
 #include "Context.h"
 #include "RecordJson.h"
 
-#include "contacts/Constants.h"
+#include "contacts/records/Constants.h"
 
 #include <fmt/format.h>
 

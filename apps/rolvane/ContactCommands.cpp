@@ -7,9 +7,9 @@
 #include "SafeText.h"
 #include "Subscriptions.h"
 
-#include "contacts/TextCharset.h"
-#include "contacts/VCardExport.h"
-#include "contacts/VCardImport.h"
+#include "contacts/vcard/TextCharset.h"
+#include "contacts/vcard/VCardExport.h"
+#include "contacts/vcard/VCardImport.h"
 #include "foundation/PropertyList.h"
 
 #include <algorithm>

@@ -3,7 +3,7 @@
 #include "Examples.h"
 #include "SafeText.h"
 
-#include "contacts/DamagedDatabase.h"
+#include "contacts/database/DamagedDatabase.h"
 #include "daemon/InstanceLock.h"
 #include "foundation/Preferences.h"
 

@@ -9,12 +9,12 @@
 #include "Subscriptions.h"
 #include "Withdrawn.h"
 
-#include "conduits/EndedPublication.h"
+#include "conduits/store/EndedPublication.h"
 #include "daemon/DaemonControl.h"
-#include "engine/DatabaseCare.h"
-#include "engine/EngineState.h"
-#include "engine/PassOutcome.h"
-#include "store/CXDAVManager.h"
+#include "engine/memory/EngineState.h"
+#include "engine/pass/PassOutcome.h"
+#include "engine/recovery/DatabaseCare.h"
+#include "store/dav/CXDAVManager.h"
 
 #include <csignal>
 #include <fmt/format.h>

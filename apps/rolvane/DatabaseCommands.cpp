@@ -1,6 +1,6 @@
 #include "Context.h"
 
-#include "contacts/DamagedDatabase.h"
+#include "contacts/database/DamagedDatabase.h"
 #include "daemon/DaemonControl.h"
 
 namespace rolvane::cli {

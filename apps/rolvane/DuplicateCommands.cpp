@@ -3,7 +3,7 @@
 #include "Lookup.h"
 #include "SafeText.h"
 
-#include "contacts/PersonJoining.h"
+#include "contacts/records/PersonJoining.h"
 
 #include <fmt/format.h>
 #include <fmt/ranges.h>

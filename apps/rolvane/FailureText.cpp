@@ -1,7 +1,7 @@
 #include "FailureText.h"
 
-#include "engine/StoreFailures.h"
-#include "store/CXDAVManager.h"
+#include "engine/pass/StoreFailures.h"
+#include "store/dav/CXDAVManager.h"
 
 #include <fmt/format.h>
 

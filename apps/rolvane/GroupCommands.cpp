@@ -4,7 +4,7 @@
 #include "RecordJson.h"
 #include "Subscriptions.h"
 
-#include "contacts/Constants.h"
+#include "contacts/records/Constants.h"
 
 #include <algorithm>
 #include <fmt/format.h>

@@ -2,7 +2,7 @@
 
 #include "Context.h"
 
-#include "contacts/VCardImport.h"
+#include "contacts/vcard/VCardImport.h"
 
 namespace rolvane::cli {
 

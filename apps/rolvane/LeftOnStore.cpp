@@ -3,10 +3,10 @@
 #include "Publication.h"
 
 #include "conduits/PublishedLayout.h"
-#include "contacts/Identifier.h"
+#include "contacts/records/Identifier.h"
 #include "foundation/PropertyList.h"
-#include "store/CXDAVManager.h"
-#include "store/CXWebDAVLock.h"
+#include "store/dav/CXDAVManager.h"
+#include "store/locks/CXWebDAVLock.h"
 
 #include <algorithm>
 #include <fmt/format.h>

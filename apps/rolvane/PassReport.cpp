@@ -4,7 +4,7 @@
 #include "FailureText.h"
 
 #include "daemon/DaemonControl.h"
-#include "store/CXDAVManager.h"
+#include "store/dav/CXDAVManager.h"
 
 #include <fmt/format.h>
 

@@ -2,7 +2,7 @@
 
 #include "Context.h"
 
-#include "engine/PassOutcome.h"
+#include "engine/pass/PassOutcome.h"
 
 #include <string>
 #include <vector>

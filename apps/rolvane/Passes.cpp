@@ -4,7 +4,7 @@
 #include "Publication.h"
 
 #include "daemon/DaemonControl.h"
-#include "store/CXDAVManager.h"
+#include "store/dav/CXDAVManager.h"
 
 #include <algorithm>
 #include <chrono>

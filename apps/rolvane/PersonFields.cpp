@@ -2,7 +2,7 @@
 
 #include "Context.h"
 
-#include "contacts/Constants.h"
+#include "contacts/records/Constants.h"
 #include "foundation/Paths.h"
 
 #include <algorithm>

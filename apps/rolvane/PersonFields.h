@@ -1,6 +1,6 @@
 #pragma once
 
-#include "contacts/CXPerson.h"
+#include "contacts/records/CXPerson.h"
 
 #include <CLI/CLI.hpp>
 #include <string>

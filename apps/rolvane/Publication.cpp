@@ -2,13 +2,13 @@
 
 #include "Shares.h"
 
-#include "conduits/EndedPublication.h"
-#include "contacts/Constants.h"
-#include "contacts/Identifier.h"
-#include "contacts/SharingDates.h"
-#include "engine/EngineState.h"
-#include "engine/PublicationCache.h"
-#include "engine/RefusedChanges.h"
+#include "conduits/store/EndedPublication.h"
+#include "contacts/records/Constants.h"
+#include "contacts/records/Identifier.h"
+#include "contacts/records/SharingDates.h"
+#include "engine/memory/EngineState.h"
+#include "engine/memory/PublicationCache.h"
+#include "engine/queue/RefusedChanges.h"
 #include "model/RemoteLocationMap.h"
 
 #include <algorithm>

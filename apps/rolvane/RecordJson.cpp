@@ -3,8 +3,8 @@
 #include "SafeText.h"
 #include "Subscriptions.h"
 
-#include "contacts/Constants.h"
-#include "contacts/VCardFields.h"
+#include "contacts/records/Constants.h"
+#include "contacts/vcard/VCardFields.h"
 #include "foundation/Base64.h"
 
 #include <algorithm>

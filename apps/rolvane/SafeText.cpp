@@ -1,6 +1,6 @@
 #include "SafeText.h"
 
-#include "contacts/VCardText.h"
+#include "contacts/vcard/VCardText.h"
 
 #include <algorithm>
 #include <cstdint>

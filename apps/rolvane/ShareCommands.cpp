@@ -10,7 +10,7 @@
 #include "daemon/DaemonControl.h"
 #include "model/CXDChangeRecord.h"
 #include "model/RemoteLocationMap.h"
-#include "store/CXDAVManager.h"
+#include "store/dav/CXDAVManager.h"
 
 #include <algorithm>
 #include <fmt/format.h>

@@ -2,8 +2,8 @@
 
 #include "Publication.h"
 
-#include "contacts/Constants.h"
-#include "contacts/SharingDates.h"
+#include "contacts/records/Constants.h"
+#include "contacts/records/SharingDates.h"
 #include "foundation/Date.h"
 
 #include <algorithm>

@@ -1,6 +1,6 @@
 #pragma once
 
-#include "contacts/CXRolvane.h"
+#include "contacts/database/CXRolvane.h"
 
 #include <optional>
 #include <string>
@@ -11,7 +11,7 @@ namespace rolvane::cli {
 // With whom the owner shares, in the contact database: kCXReadSharingACLProperty of the all-contacts group names those
 // who may read, kCXReadWriteSharingACLProperty those of them who may write, too. The daemon carries both to the store.
 //
-// Two more properties of that group note since when each of them may (contacts/SharingDates.h).
+// Two more properties of that group note since when each of them may (contacts/records/SharingDates.h).
 //
 // While only single groups are published nothing is carried for the all-contacts group, so each published group has the
 // same two properties then.

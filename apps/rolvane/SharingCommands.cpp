@@ -7,7 +7,7 @@
 #include "Publication.h"
 
 #include "daemon/DaemonControl.h"
-#include "store/CXDAVManager.h"
+#include "store/dav/CXDAVManager.h"
 
 #include <fmt/format.h>
 #include <functional>

@@ -7,11 +7,11 @@
 
 #include "conduits/PublishedLayout.h"
 #include "daemon/DaemonControl.h"
-#include "engine/EngineState.h"
-#include "engine/StoreFailures.h"
+#include "engine/memory/EngineState.h"
+#include "engine/pass/StoreFailures.h"
 #include "foundation/Log.h"
 #include "model/RemoteLocationMap.h"
-#include "store/CXDAVManager.h"
+#include "store/dav/CXDAVManager.h"
 
 #include <fmt/format.h>
 

@@ -4,9 +4,9 @@
 #include "Publication.h"
 
 #include "conduits/PublishedLayout.h"
-#include "engine/EngineState.h"
+#include "engine/memory/EngineState.h"
 #include "model/RemoteLocationMap.h"
-#include "store/CXDAVManager.h"
+#include "store/dav/CXDAVManager.h"
 
 #include <algorithm>
 #include <fmt/format.h>

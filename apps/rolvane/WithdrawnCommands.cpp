@@ -3,7 +3,7 @@
 #include "ImportReport.h"
 #include "Withdrawn.h"
 
-#include "contacts/WithdrawnContacts.h"
+#include "contacts/database/WithdrawnContacts.h"
 
 #include <fmt/format.h>
 

@@ -2,8 +2,8 @@
 
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
-#include "store/CXDAVManager.h"
-#include "store/CXDAVQuery.h"
+#include "store/dav/CXDAVManager.h"
+#include "store/dav/CXDAVQuery.h"
 
 #include <algorithm>
 #include <functional>

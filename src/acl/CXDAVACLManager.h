@@ -1,7 +1,7 @@
 #pragma once
 
 #include "acl/CXACLManager.h"
-#include "store/CXACE.h"
+#include "store/dav/CXACE.h"
 
 #include <map>
 #include <optional>

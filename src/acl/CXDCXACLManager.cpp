@@ -1,7 +1,7 @@
 #include "acl/CXDCXACLManager.h"
 
-#include "contacts/CXRolvane.h"
-#include "contacts/Constants.h"
+#include "contacts/database/CXRolvane.h"
+#include "contacts/records/Constants.h"
 
 #include <algorithm>
 #include <cstdint>

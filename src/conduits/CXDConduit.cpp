@@ -1,8 +1,8 @@
 #include "conduits/CXDConduit.h"
 
 #include "conduits/PublishedLayout.h"
-#include "contacts/CXMultiValue.h"
-#include "contacts/Constants.h"
+#include "contacts/records/CXMultiValue.h"
+#include "contacts/records/Constants.h"
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
 #include "foundation/PropertyList.h"

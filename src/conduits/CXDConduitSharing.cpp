@@ -2,8 +2,8 @@
 
 #include "conduits/CXDConduit.h"
 #include "conduits/WithdrawalNotice.h"
-#include "contacts/CXRolvane.h"
-#include "contacts/Constants.h"
+#include "contacts/database/CXRolvane.h"
+#include "contacts/records/Constants.h"
 #include "foundation/Preferences.h"
 
 namespace rolvane {

@@ -1,7 +1,7 @@
 #include "conduits/PublishedLayout.h"
 
 #include "acl/CXACLManager.h"
-#include "contacts/Constants.h"
+#include "contacts/records/Constants.h"
 #include "foundation/Utf8.h"
 #include "model/PayloadKeys.h"
 

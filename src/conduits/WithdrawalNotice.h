@@ -1,6 +1,6 @@
 #pragma once
 
-#include "contacts/WithdrawnContacts.h"
+#include "contacts/database/WithdrawnContacts.h"
 
 namespace rolvane {
 

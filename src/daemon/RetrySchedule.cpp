@@ -1,6 +1,6 @@
 #include "daemon/RetrySchedule.h"
 
-#include "store/CXDAVManager.h"
+#include "store/dav/CXDAVManager.h"
 
 #include <algorithm>
 #include <cmath>

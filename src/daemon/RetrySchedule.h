@@ -1,6 +1,6 @@
 #pragma once
 
-#include "engine/PassOutcome.h"
+#include "engine/pass/PassOutcome.h"
 
 #include <deque>
 #include <optional>

@@ -1,6 +1,6 @@
 #pragma once
 
-#include "engine/PassOutcome.h"
+#include "engine/pass/PassOutcome.h"
 #include "foundation/Date.h"
 #include "foundation/Notification.h"
 #include "foundation/Preferences.h"
@@ -8,7 +8,7 @@
 #include "foundation/StrongString.h"
 #include "foundation/Value.h"
 #include "model/CXDChangeRecord.h"
-#include "store/CXWebDAVLock.h"
+#include "store/locks/CXWebDAVLock.h"
 
 #include <functional>
 #include <memory>

@@ -1,8 +1,8 @@
 #include "engine/EngineParts.h"
 
-#include "contacts/CXRolvane.h"
-#include "engine/Arrivals.h"
-#include "engine/RefusedChanges.h"
+#include "contacts/database/CXRolvane.h"
+#include "engine/queue/RefusedChanges.h"
+#include "engine/recovery/Arrivals.h"
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
 #include "model/PayloadKeys.h"

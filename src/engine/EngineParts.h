@@ -1,12 +1,12 @@
 #pragma once
 
 #include "conduits/CXDConduit.h"
-#include "engine/DeniedChanges.h"
 #include "engine/EngineCollaborators.h"
-#include "engine/EngineState.h"
-#include "engine/OutcomeKeeper.h"
-#include "engine/RemoteLocks.h"
-#include "engine/Revocation.h"
+#include "engine/memory/EngineState.h"
+#include "engine/pass/OutcomeKeeper.h"
+#include "engine/pass/RemoteLocks.h"
+#include "engine/pass/Revocation.h"
+#include "engine/queue/DeniedChanges.h"
 
 #include <atomic>
 #include <thread>

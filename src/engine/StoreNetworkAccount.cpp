@@ -1,5 +1,5 @@
 #include "engine/EngineCollaborators.h"
-#include "store/CXDAVManager.h"
+#include "store/dav/CXDAVManager.h"
 
 #include <utility>
 

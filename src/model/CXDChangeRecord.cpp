@@ -1,10 +1,10 @@
 #include "model/CXDChangeRecord.h"
 
-#include "contacts/Constants.h"
+#include "contacts/records/Constants.h"
 #include "foundation/CXException.h"
 #include "foundation/PropertyList.h"
 #include "model/PayloadKeys.h"
-#include "store/CXFileManager.h"
+#include "store/files/CXFileManager.h"
 
 #include <array>
 #include <fmt/format.h>

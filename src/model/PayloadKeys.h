@@ -27,7 +27,7 @@ inline constexpr const char* kUnsettledGroups = "unsettledGroups";
 // identifier -> true, the owner's people whose contact the store has refused: the next scan sends them whatever their
 // date, or has them removed from the store when they are gone.
 inline constexpr const char* kUnsettledPeople = "unsettledPeople";
-// How long what the owner's store has refused rests: see engine/RefusedChanges.h.
+// How long what the owner's store has refused rests: see engine/queue/RefusedChanges.h.
 inline constexpr const char* kRefusedByStore = "refusedByStore";
 // And: owner marker -> false when the owner's published tree has lost what it held, so that the next scan takes
 // everything for new; true from that scan on until all of it is written.

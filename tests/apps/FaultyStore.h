@@ -1,7 +1,7 @@
 #pragma once
 
 #include "CommandWorld.h"
-#include "store/HttpTransport.h"
+#include "store/http/HttpTransport.h"
 #include "support/FakeHttpServer.h"
 
 #include <functional>

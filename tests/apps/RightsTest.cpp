@@ -1,7 +1,7 @@
 #include "Neighbour.h"
-#include "contacts/CXRolvane.h"
-#include "contacts/Identifier.h"
-#include "contacts/SharingDates.h"
+#include "contacts/database/CXRolvane.h"
+#include "contacts/records/Identifier.h"
+#include "contacts/records/SharingDates.h"
 #include "foundation/Date.h"
 #include "support/WaitUntil.h"
 

@@ -1,9 +1,9 @@
 #include "TwoPeople.h"
 
-#include "contacts/Constants.h"
-#include "contacts/Identifier.h"
+#include "contacts/records/Constants.h"
+#include "contacts/records/Identifier.h"
 #include "foundation/PropertyList.h"
-#include "store/CXDAVManager.h"
+#include "store/dav/CXDAVManager.h"
 
 #include <filesystem>
 

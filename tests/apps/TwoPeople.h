@@ -2,7 +2,7 @@
 
 #include "Neighbour.h"
 
-#include "contacts/CXRolvane.h"
+#include "contacts/database/CXRolvane.h"
 
 #include <map>
 #include <memory>

@@ -2,7 +2,7 @@
 
 #include "CaptureWorld.h"
 #include "TestRecord.h"
-#include "store/CXFileManager.h"
+#include "store/files/CXFileManager.h"
 
 namespace rolvane::test {
 

@@ -2,10 +2,10 @@
 
 #include "DaemonDatabase.h"
 #include "FakeEngine.h"
-#include "conduits/CXDCXConduit.h"
-#include "contacts/CXRolvane.h"
-#include "contacts/Constants.h"
-#include "contacts/Identifier.h"
+#include "conduits/database/CXDCXConduit.h"
+#include "contacts/database/CXRolvane.h"
+#include "contacts/records/Constants.h"
+#include "contacts/records/Identifier.h"
 #include "foundation/Preferences.h"
 #include "support/TempHome.h"
 

@@ -1,8 +1,8 @@
 #include "conduits/CXDConduit.h"
 
 #include "FakeEngine.h"
-#include "contacts/CXMultiValue.h"
-#include "contacts/Constants.h"
+#include "contacts/records/CXMultiValue.h"
+#include "contacts/records/Constants.h"
 #include "foundation/CXException.h"
 #include "foundation/PropertyList.h"
 #include "support/CapturingLog.h"

@@ -1,8 +1,8 @@
 // Bits of the contact database that turn: whatever they are, nobody's contact is told to be deleted.
 
 #include "CaptureWorld.h"
-#include "contacts/DamagedDatabase.h"
-#include "contacts/Sqlite.h"
+#include "contacts/database/DamagedDatabase.h"
+#include "contacts/database/Sqlite.h"
 #include "foundation/Log.h"
 #include "support/CapturingLog.h"
 

@@ -1,7 +1,7 @@
-#include "conduits/GroupComparison.h"
+#include "conduits/database/GroupComparison.h"
 
 #include "FakeEngine.h"
-#include "contacts/Constants.h"
+#include "contacts/records/Constants.h"
 
 #include <gtest/gtest.h>
 #include <rapidcheck.h>

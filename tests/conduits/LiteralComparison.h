@@ -1,9 +1,9 @@
 #pragma once
 
-#include "conduits/StoreComparison.h"
-#include "contacts/CXMultiValue.h"
-#include "contacts/Constants.h"
-#include "contacts/Identifier.h"
+#include "conduits/store/StoreComparison.h"
+#include "contacts/records/CXMultiValue.h"
+#include "contacts/records/Constants.h"
+#include "contacts/records/Identifier.h"
 
 namespace rolvane::test {
 

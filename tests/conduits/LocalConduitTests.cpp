@@ -1,10 +1,10 @@
-#include "conduits/CXDLocalConduit.h"
+#include "conduits/local/CXDLocalConduit.h"
 
 #include "DaemonDatabase.h"
 #include "FakeEngine.h"
 #include "TestRecord.h"
-#include "contacts/CXRolvane.h"
-#include "contacts/Constants.h"
+#include "contacts/database/CXRolvane.h"
+#include "contacts/records/Constants.h"
 #include "foundation/Paths.h"
 #include "foundation/Preferences.h"
 #include "foundation/PropertyList.h"

@@ -1,6 +1,6 @@
 #include "conduits/PublishedLayout.h"
 
-#include "contacts/Constants.h"
+#include "contacts/records/Constants.h"
 
 #include <algorithm>
 #include <gtest/gtest.h>

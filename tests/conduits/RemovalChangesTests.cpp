@@ -1,4 +1,4 @@
-#include "conduits/RemovalChanges.h"
+#include "conduits/database/RemovalChanges.h"
 
 #include "FakeEngine.h"
 

@@ -1,4 +1,4 @@
-#include "conduits/StoreComparison.h"
+#include "conduits/store/StoreComparison.h"
 
 #include "FakeEngine.h"
 #include "LiteralComparison.h"

@@ -2,12 +2,12 @@
 #include "DaemonDatabase.h"
 #include "FakeEngine.h"
 #include "acl/CXDAVACLManager.h"
-#include "conduits/CXDVaultraConduit.h"
 #include "conduits/UserAlert.h"
-#include "contacts/CXRolvane.h"
-#include "contacts/Constants.h"
+#include "conduits/store/CXDVaultraConduit.h"
+#include "contacts/database/CXRolvane.h"
+#include "contacts/records/Constants.h"
 #include "foundation/Preferences.h"
-#include "store/CXNetworkController.h"
+#include "store/account/CXNetworkController.h"
 #include "support/CapturingLog.h"
 
 #include <gtest/gtest.h>

@@ -1,9 +1,9 @@
 #include "conduits/CXDConduit.h"
 
 #include "CaptureWorld.h"
-#include "contacts/CXMultiValue.h"
+#include "contacts/records/CXMultiValue.h"
 #include "foundation/CXException.h"
-#include "store/CXFileManager.h"
+#include "store/files/CXFileManager.h"
 #include "support/CapturingLog.h"
 
 #include <gtest/gtest.h>

@@ -1,6 +1,6 @@
-#include "conduits/TreeCondition.h"
+#include "conduits/store/TreeCondition.h"
 
-#include "conduits/StoreComparison.h"
+#include "conduits/store/StoreComparison.h"
 #include "model/PayloadKeys.h"
 
 #include <gtest/gtest.h>

@@ -1,14 +1,14 @@
-#include "conduits/CXDVaultraConduit.h"
+#include "conduits/store/CXDVaultraConduit.h"
 
 #include "../store/StoreWorld.h"
 #include "FakeEngine.h"
 #include "TestRecord.h"
 #include "conduits/UserAlert.h"
-#include "contacts/CXRolvane.h"
-#include "contacts/Constants.h"
+#include "contacts/database/CXRolvane.h"
+#include "contacts/records/Constants.h"
 #include "foundation/Preferences.h"
 #include "foundation/PropertyList.h"
-#include "store/CXNetworkController.h"
+#include "store/account/CXNetworkController.h"
 #include "support/CapturingLog.h"
 
 #include <atomic>

@@ -1,5 +1,5 @@
-#include "contacts/CXMerger.h"
-#include "contacts/Constants.h"
+#include "contacts/records/CXMerger.h"
+#include "contacts/records/Constants.h"
 
 #include <gtest/gtest.h>
 #include <rapidcheck/gtest.h>

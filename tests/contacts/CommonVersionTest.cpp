@@ -1,6 +1,6 @@
 #include "TestDatabase.h"
 
-#include "contacts/Constants.h"
+#include "contacts/records/Constants.h"
 #include "foundation/PropertyList.h"
 
 #include <gtest/gtest.h>

@@ -1,8 +1,8 @@
-#include "contacts/ContactMerge.h"
+#include "contacts/records/ContactMerge.h"
 
-#include "contacts/CXMerger.h"
-#include "contacts/CXMultiValue.h"
-#include "contacts/Constants.h"
+#include "contacts/records/CXMerger.h"
+#include "contacts/records/CXMultiValue.h"
+#include "contacts/records/Constants.h"
 
 #include <algorithm>
 #include <gtest/gtest.h>

@@ -3,8 +3,8 @@
 #include "DamagedIndex.h"
 #include "TestDatabase.h"
 
-#include "contacts/DamagedDatabase.h"
-#include "contacts/Sqlite.h"
+#include "contacts/database/DamagedDatabase.h"
+#include "contacts/database/Sqlite.h"
 #include "foundation/Preferences.h"
 
 #include <filesystem>

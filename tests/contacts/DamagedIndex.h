@@ -1,6 +1,6 @@
 #pragma once
 
-#include "contacts/Sqlite.h"
+#include "contacts/database/Sqlite.h"
 
 #include <gtest/gtest.h>
 #include <string>

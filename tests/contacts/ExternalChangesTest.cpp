@@ -1,6 +1,6 @@
 #include "TestDatabase.h"
 
-#include "contacts/Sqlite.h"
+#include "contacts/database/Sqlite.h"
 #include "support/PrivateBus.h"
 #include "support/WaitUntil.h"
 

@@ -1,4 +1,4 @@
-#include "contacts/Identifier.h"
+#include "contacts/records/Identifier.h"
 
 #include <set>
 

@@ -1,6 +1,6 @@
 #include "TestDatabase.h"
 
-#include "contacts/Journal.h"
+#include "contacts/database/Journal.h"
 
 #include <map>
 #include <random>

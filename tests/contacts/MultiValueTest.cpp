@@ -1,5 +1,5 @@
-#include "contacts/CXMultiValue.h"
-#include "contacts/Constants.h"
+#include "contacts/records/CXMultiValue.h"
+#include "contacts/records/Constants.h"
 
 #include <gtest/gtest.h>
 #include <rapidcheck/gtest.h>

@@ -1,7 +1,7 @@
 #include "TestDatabase.h"
 
-#include "contacts/PersonJoining.h"
-#include "contacts/VCardImport.h"
+#include "contacts/records/PersonJoining.h"
+#include "contacts/vcard/VCardImport.h"
 
 #include <gtest/gtest.h>
 

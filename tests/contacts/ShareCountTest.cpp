@@ -1,7 +1,7 @@
 #include "TestDatabase.h"
 
-#include "contacts/CXUserDefaults.h"
-#include "contacts/ShareCountBump.h"
+#include "contacts/database/CXUserDefaults.h"
+#include "contacts/database/ShareCountBump.h"
 #include "foundation/Preferences.h"
 
 #include <filesystem>

@@ -1,6 +1,6 @@
 #include "TestDatabase.h"
 
-#include "contacts/SharedForms.h"
+#include "contacts/database/SharedForms.h"
 
 #include <rapidcheck/gtest.h>
 

@@ -1,6 +1,6 @@
 #pragma once
 
-#include "contacts/CXRolvane.h"
+#include "contacts/database/CXRolvane.h"
 #include "support/TempHome.h"
 
 #include <functional>

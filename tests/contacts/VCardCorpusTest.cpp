@@ -4,9 +4,9 @@
 #include "TestDatabase.h"
 #include "VCardGenerators.h"
 
-#include "contacts/VCardExport.h"
-#include "contacts/VCardImport.h"
-#include "contacts/VCardText.h"
+#include "contacts/vcard/VCardExport.h"
+#include "contacts/vcard/VCardImport.h"
+#include "contacts/vcard/VCardText.h"
 #include "foundation/PropertyList.h"
 
 #include <gtest/gtest.h>

@@ -1,7 +1,7 @@
 #pragma once
 
-#include "contacts/VCardExport.h"
-#include "contacts/VCardImport.h"
+#include "contacts/vcard/VCardExport.h"
+#include "contacts/vcard/VCardImport.h"
 
 #include <sstream>
 #include <string>

@@ -4,10 +4,10 @@
 #include "VCardFiles.h"
 #include "VCardGenerators.h"
 
-#include "contacts/TextCharset.h"
-#include "contacts/VCardExport.h"
-#include "contacts/VCardImport.h"
-#include "contacts/VCardText.h"
+#include "contacts/vcard/TextCharset.h"
+#include "contacts/vcard/VCardExport.h"
+#include "contacts/vcard/VCardImport.h"
+#include "contacts/vcard/VCardText.h"
 
 #include <gtest/gtest.h>
 

@@ -1,9 +1,9 @@
 #pragma once
 
-#include "contacts/CXMultiValue.h"
-#include "contacts/Constants.h"
-#include "contacts/VCardReader.h"
-#include "contacts/VCardWriter.h"
+#include "contacts/records/CXMultiValue.h"
+#include "contacts/records/Constants.h"
+#include "contacts/vcard/VCardReader.h"
+#include "contacts/vcard/VCardWriter.h"
 
 #include <gtest/gtest.h>
 #include <rapidcheck/gtest.h>

@@ -2,9 +2,9 @@
 #include "VCardFiles.h"
 #include "VCardGenerators.h"
 
-#include "contacts/VCardExport.h"
-#include "contacts/VCardFields.h"
-#include "contacts/VCardImport.h"
+#include "contacts/vcard/VCardExport.h"
+#include "contacts/vcard/VCardFields.h"
+#include "contacts/vcard/VCardImport.h"
 #include "foundation/PropertyList.h"
 
 #include <gtest/gtest.h>

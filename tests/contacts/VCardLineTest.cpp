@@ -1,5 +1,5 @@
-#include "contacts/VCardLine.h"
-#include "contacts/VCardText.h"
+#include "contacts/vcard/VCardLine.h"
+#include "contacts/vcard/VCardText.h"
 
 #include <gtest/gtest.h>
 #include <rapidcheck/gtest.h>

@@ -3,8 +3,8 @@
 
 #include "VCardGenerators.h"
 
-#include "contacts/VCardFields.h"
-#include "contacts/VCardText.h"
+#include "contacts/vcard/VCardFields.h"
+#include "contacts/vcard/VCardText.h"
 #include "foundation/PropertyList.h"
 #include "support/CpuTime.h"
 

@@ -2,9 +2,9 @@
 
 #include "VCardGenerators.h"
 
-#include "contacts/VCardFields.h"
-#include "contacts/VCardLabels.h"
-#include "contacts/VCardText.h"
+#include "contacts/vcard/VCardFields.h"
+#include "contacts/vcard/VCardLabels.h"
+#include "contacts/vcard/VCardText.h"
 
 #include <libebook-contacts/libebook-contacts.h>
 

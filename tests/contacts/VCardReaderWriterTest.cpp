@@ -1,7 +1,7 @@
 #include "VCardGenerators.h"
 
-#include "contacts/VCardFields.h"
-#include "contacts/VCardText.h"
+#include "contacts/vcard/VCardFields.h"
+#include "contacts/vcard/VCardText.h"
 #include "foundation/PropertyList.h"
 
 #include <gtest/gtest.h>

@@ -1,4 +1,4 @@
-#include "contacts/VCardScanner.h"
+#include "contacts/vcard/VCardScanner.h"
 #include "foundation/CXException.h"
 
 #include <gtest/gtest.h>

@@ -1,7 +1,7 @@
-#include "contacts/WithdrawnContacts.h"
+#include "contacts/database/WithdrawnContacts.h"
 
-#include "contacts/Constants.h"
-#include "contacts/VCardImport.h"
+#include "contacts/records/Constants.h"
+#include "contacts/vcard/VCardImport.h"
 #include "foundation/CXException.h"
 #include "support/TempHome.h"
 

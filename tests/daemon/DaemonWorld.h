@@ -1,8 +1,8 @@
 #pragma once
 
-#include "contacts/CXRolvane.h"
+#include "contacts/database/CXRolvane.h"
 #include "foundation/Preferences.h"
-#include "store/Account.h"
+#include "store/account/Account.h"
 #include "support/UserWorld.h"
 
 #include <memory>

@@ -1,7 +1,7 @@
 #include "DaemonWorld.h"
 
-#include "contacts/Identifier.h"
-#include "engine/EngineState.h"
+#include "contacts/records/Identifier.h"
+#include "engine/memory/EngineState.h"
 #include "foundation/Paths.h"
 
 #include <csignal>

@@ -1,9 +1,9 @@
 #include "EngineWorld.h"
 
 #include "Writes.h"
-#include "engine/EngineState.h"
+#include "engine/memory/EngineState.h"
 #include "foundation/CXException.h"
-#include "store/CXFileManager.h"
+#include "store/files/CXFileManager.h"
 #include "support/CapturingLog.h"
 
 #include <gtest/gtest.h>

@@ -1,4 +1,4 @@
-#include "engine/DeniedChanges.h"
+#include "engine/queue/DeniedChanges.h"
 
 #include "Records.h"
 

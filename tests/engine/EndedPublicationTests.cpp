@@ -1,10 +1,10 @@
 // The store says that the owner's tree is forbidden, gone or another one. The publication ends, and whom the owner has
 // shut out meanwhile does not keep the right to read without a word.
 
-#include "conduits/EndedPublication.h"
+#include "conduits/store/EndedPublication.h"
 
 #include "TwoUsers.h"
-#include "engine/EngineState.h"
+#include "engine/memory/EngineState.h"
 
 namespace rolvane::test {
 namespace {

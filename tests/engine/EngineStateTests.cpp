@@ -1,6 +1,6 @@
 #include "EngineWorld.h"
 
-#include "engine/EngineState.h"
+#include "engine/memory/EngineState.h"
 #include "foundation/KeyedArchive.h"
 #include "support/CapturingLog.h"
 

@@ -2,7 +2,7 @@
 
 #include "Records.h"
 #include "conduits/CXDConduit.h"
-#include "contacts/CXRolvane.h"
+#include "contacts/database/CXRolvane.h"
 #include "engine/CXDSyncEngine.h"
 #include "foundation/Preferences.h"
 #include "foundation/RunLoop.h"

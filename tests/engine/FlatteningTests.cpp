@@ -1,4 +1,4 @@
-#include "engine/ChangeQueue.h"
+#include "engine/queue/ChangeQueue.h"
 
 #include "Records.h"
 #include "support/CpuTime.h"

@@ -1,8 +1,8 @@
 // The last one leaves: a tree that is emptied contact by contact, and group by group, is empty everywhere.
 
 #include "TwoUsers.h"
-#include "contacts/CXSubscription.h"
-#include "engine/EngineState.h"
+#include "contacts/records/CXSubscription.h"
+#include "engine/memory/EngineState.h"
 
 namespace rolvane::test {
 

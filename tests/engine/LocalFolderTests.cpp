@@ -1,4 +1,4 @@
-#include "conduits/CXDLocalConduit.h"
+#include "conduits/local/CXDLocalConduit.h"
 
 #include "EngineWorld.h"
 

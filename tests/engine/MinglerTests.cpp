@@ -1,4 +1,4 @@
-#include "engine/Mingler.h"
+#include "engine/queue/Mingler.h"
 
 #include "Records.h"
 

@@ -1,4 +1,4 @@
-#include "engine/OutOfOrderWork.h"
+#include "engine/pass/OutOfOrderWork.h"
 
 #include "EngineWorld.h"
 

@@ -2,13 +2,13 @@
 
 #include "../store/StoreWorld.h"
 #include "EngineWorld.h"
-#include "conduits/CXDCXConduit.h"
-#include "conduits/CXDVaultraConduit.h"
 #include "conduits/UserAlert.h"
 #include "conduits/WithdrawalNotice.h"
-#include "contacts/Constants.h"
-#include "contacts/Identifier.h"
-#include "store/CXNetworkController.h"
+#include "conduits/database/CXDCXConduit.h"
+#include "conduits/store/CXDVaultraConduit.h"
+#include "contacts/records/Constants.h"
+#include "contacts/records/Identifier.h"
+#include "store/account/CXNetworkController.h"
 
 #include <filesystem>
 #include <map>

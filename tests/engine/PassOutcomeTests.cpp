@@ -1,4 +1,4 @@
-#include "engine/PassOutcome.h"
+#include "engine/pass/PassOutcome.h"
 
 #include "EngineWorld.h"
 #include "foundation/CXException.h"

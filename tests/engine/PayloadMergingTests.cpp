@@ -1,7 +1,7 @@
-#include "engine/PayloadMerging.h"
+#include "engine/queue/PayloadMerging.h"
 
 #include "Records.h"
-#include "contacts/CXMerger.h"
+#include "contacts/records/CXMerger.h"
 
 #include <gtest/gtest.h>
 

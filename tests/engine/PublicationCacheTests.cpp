@@ -1,7 +1,7 @@
-#include "engine/PublicationCache.h"
+#include "engine/memory/PublicationCache.h"
 
 #include "Records.h"
-#include "contacts/Identifier.h"
+#include "contacts/records/Identifier.h"
 
 #include <algorithm>
 #include <gtest/gtest.h>

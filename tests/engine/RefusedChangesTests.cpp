@@ -1,8 +1,8 @@
 // The owner's own store refuses the owner's changes: for lack of rights in the whole tree, or in a part of it.
 
-#include "engine/RefusedChanges.h"
+#include "engine/queue/RefusedChanges.h"
 
-#include "engine/EngineState.h"
+#include "engine/memory/EngineState.h"
 
 #include "TwoUsers.h"
 

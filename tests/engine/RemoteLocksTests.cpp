@@ -1,4 +1,4 @@
-#include "engine/RemoteLocks.h"
+#include "engine/pass/RemoteLocks.h"
 
 #include "Records.h"
 #include "foundation/CXException.h"

@@ -1,7 +1,7 @@
-#include "engine/TakenOut.h"
+#include "engine/queue/TakenOut.h"
 
 #include "Records.h"
-#include "contacts/Constants.h"
+#include "contacts/records/Constants.h"
 #include "model/PayloadKeys.h"
 
 #include <gtest/gtest.h>

@@ -2,7 +2,7 @@
 
 #include "TwoUsers.h"
 #include "Writes.h"
-#include "contacts/Sqlite.h"
+#include "contacts/database/Sqlite.h"
 #include "foundation/CXException.h"
 
 #include <cstdlib>

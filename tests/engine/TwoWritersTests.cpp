@@ -2,7 +2,7 @@
 
 #include "TwoUsers.h"
 #include "Writes.h"
-#include "engine/EngineState.h"
+#include "engine/memory/EngineState.h"
 #include "foundation/CXException.h"
 
 namespace rolvane::test {

@@ -1,8 +1,8 @@
 #include "EngineWorld.h"
 
-#include "contacts/Constants.h"
-#include "engine/EngineState.h"
-#include "engine/UnderWay.h"
+#include "contacts/records/Constants.h"
+#include "engine/memory/EngineState.h"
+#include "engine/recovery/UnderWay.h"
 #include "model/PayloadKeys.h"
 
 #include <gmock/gmock.h>

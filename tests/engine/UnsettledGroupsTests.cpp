@@ -1,7 +1,7 @@
-#include "engine/UnsettledGroups.h"
+#include "engine/recovery/UnsettledGroups.h"
 
 #include "Records.h"
-#include "contacts/Identifier.h"
+#include "contacts/records/Identifier.h"
 
 #include <algorithm>
 #include <gtest/gtest.h>

@@ -1,5 +1,5 @@
 #include "model/CXDChangeRecord.h"
-#include "store/CXFileManager.h"
+#include "store/files/CXFileManager.h"
 
 #include <gtest/gtest.h>
 

@@ -1,6 +1,6 @@
 #include "model/CXDChangeRecord.h"
 
-#include "contacts/Constants.h"
+#include "contacts/records/Constants.h"
 #include "foundation/CXException.h"
 #include "model/PayloadKeys.h"
 

@@ -1,7 +1,7 @@
 #include "AclStore.h"
 #include "StoreWorld.h"
-#include "store/CXACE.h"
-#include "store/CXDAVQuery.h"
+#include "store/dav/CXACE.h"
+#include "store/dav/CXDAVQuery.h"
 #include "support/CapturingLog.h"
 
 #include <gtest/gtest.h>

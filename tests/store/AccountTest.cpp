@@ -1,8 +1,8 @@
-#include "store/Account.h"
+#include "store/account/Account.h"
 #include "foundation/CXException.h"
 #include "foundation/Paths.h"
-#include "store/CXNetworkController.h"
-#include "store/VersionMemory.h"
+#include "store/account/CXNetworkController.h"
+#include "store/reads/VersionMemory.h"
 #include "support/TempHome.h"
 
 #include <csignal>

@@ -1,8 +1,8 @@
 #pragma once
 
 #include "RecordingTransport.h"
-#include "store/CXDAVManager.h"
-#include "store/CXDAVNode.h"
+#include "store/dav/CXDAVManager.h"
+#include "store/dav/CXDAVNode.h"
 #include "support/TempHome.h"
 
 #include <algorithm>

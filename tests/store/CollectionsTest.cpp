@@ -1,6 +1,6 @@
-#include "store/Collections.h"
+#include "store/dav/Collections.h"
 #include "StoreWorld.h"
-#include "store/StoreLock.h"
+#include "store/locks/StoreLock.h"
 
 #include <gtest/gtest.h>
 

@@ -1,4 +1,4 @@
-#include "store/EarlyReads.h"
+#include "store/reads/EarlyReads.h"
 
 #include "ManyContacts.h"
 #include "RecordingTransport.h"

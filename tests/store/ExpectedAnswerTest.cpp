@@ -1,7 +1,7 @@
-#include "store/ExpectedAnswer.h"
+#include "store/http/ExpectedAnswer.h"
 #include "RecordingTransport.h"
 #include "StoreWorld.h"
-#include "store/CXWebDAVLock.h"
+#include "store/locks/CXWebDAVLock.h"
 
 #include <atomic>
 #include <gtest/gtest.h>

@@ -1,6 +1,6 @@
 #include "StoreWorld.h"
 #include "foundation/PropertyList.h"
-#include "store/StoreLock.h"
+#include "store/locks/StoreLock.h"
 #include "support/CapturingLog.h"
 
 #include <atomic>

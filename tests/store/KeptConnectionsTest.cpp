@@ -1,7 +1,7 @@
-#include "store/KeptConnections.h"
+#include "store/http/KeptConnections.h"
 #include "Http2Server.h"
 #include "StoreWorld.h"
-#include "store/CXWebDAVLock.h"
+#include "store/locks/CXWebDAVLock.h"
 #include "support/FakeHttpServer.h"
 #include "support/WaitUntil.h"
 

@@ -1,7 +1,7 @@
-#include "store/ListingMemory.h"
+#include "store/reads/ListingMemory.h"
 
 #include "RecordingTransport.h"
-#include "store/CXDAVManager.h"
+#include "store/dav/CXDAVManager.h"
 #include "support/TempHome.h"
 
 #include <gtest/gtest.h>

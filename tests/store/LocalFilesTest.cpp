@@ -1,7 +1,7 @@
-#include "store/LocalFiles.h"
+#include "store/files/LocalFiles.h"
 
 #include "foundation/PropertyList.h"
-#include "store/CXDAVManager.h"
+#include "store/dav/CXDAVManager.h"
 #include "support/TempHome.h"
 
 #include <atomic>

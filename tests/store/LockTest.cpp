@@ -1,7 +1,7 @@
 #include "StoreWorld.h"
 #include "foundation/Paths.h"
-#include "store/CXWebDAVLock.h"
-#include "store/StoreLock.h"
+#include "store/locks/CXWebDAVLock.h"
+#include "store/locks/StoreLock.h"
 #include "support/ChildProcess.h"
 
 #include <chrono>

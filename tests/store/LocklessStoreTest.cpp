@@ -1,10 +1,10 @@
 // Stores that keep no locks, and stores that only seem to.
 
 #include "StoreWorld.h"
-#include "store/CXWebDAVLock.h"
-#include "store/LockAnswers.h"
-#include "store/LockTokens.h"
-#include "store/RequestFailures.h"
+#include "store/http/RequestFailures.h"
+#include "store/locks/CXWebDAVLock.h"
+#include "store/locks/LockAnswers.h"
+#include "store/locks/LockTokens.h"
 
 #include <gtest/gtest.h>
 #include <thread>

@@ -2,8 +2,8 @@
 
 #include "StoreWorld.h"
 #include "foundation/Paths.h"
-#include "store/CXWebDAVLock.h"
-#include "store/RequestFailures.h"
+#include "store/http/RequestFailures.h"
+#include "store/locks/CXWebDAVLock.h"
 
 #include <filesystem>
 #include <functional>

@@ -1,9 +1,9 @@
 // Servers that people have, each with habits of its own.
 
 #include "StoreWorld.h"
-#include "store/CXWebDAVLock.h"
-#include "store/StoreLock.h"
-#include "store/StoreTrial.h"
+#include "store/account/StoreTrial.h"
+#include "store/locks/CXWebDAVLock.h"
+#include "store/locks/StoreLock.h"
 #include "support/OddServer.h"
 
 #include <functional>

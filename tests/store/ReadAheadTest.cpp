@@ -1,4 +1,4 @@
-#include "store/ReadAhead.h"
+#include "store/reads/ReadAhead.h"
 
 #include "ManyContacts.h"
 #include "RecordingTransport.h"

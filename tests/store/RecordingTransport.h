@@ -1,6 +1,6 @@
 #pragma once
 
-#include "store/HttpTransport.h"
+#include "store/http/HttpTransport.h"
 
 #include <functional>
 #include <mutex>

@@ -1,6 +1,6 @@
-#include "store/RequestFailures.h"
+#include "store/http/RequestFailures.h"
 #include "RecordingTransport.h"
-#include "store/CXDAVManager.h"
+#include "store/dav/CXDAVManager.h"
 
 #include <gtest/gtest.h>
 #include <string>

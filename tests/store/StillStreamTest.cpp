@@ -1,5 +1,5 @@
 #include "Http2Server.h"
-#include "store/HttpTransport.h"
+#include "store/http/HttpTransport.h"
 #include "support/TempHome.h"
 
 #include <gtest/gtest.h>

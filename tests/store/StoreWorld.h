@@ -3,7 +3,7 @@
 #include "RecordingTransport.h"
 #include "foundation/PropertyList.h"
 #include "server/PrivateStore.h"
-#include "store/CXDAVManager.h"
+#include "store/dav/CXDAVManager.h"
 #include "support/TempHome.h"
 
 #include <filesystem>

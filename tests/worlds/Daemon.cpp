@@ -1,10 +1,10 @@
 #include "Daemon.h"
 
-#include "conduits/CXDCXConduit.h"
-#include "conduits/CXDVaultraConduit.h"
+#include "conduits/database/CXDCXConduit.h"
+#include "conduits/store/CXDVaultraConduit.h"
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
-#include "store/StoreLock.h"
+#include "store/locks/StoreLock.h"
 
 #include <unistd.h>
 

@@ -9,8 +9,8 @@
 #include "engine/IdleExit.h"
 #include "foundation/Preferences.h"
 #include "foundation/RunLoop.h"
-#include "store/CXDAVManager.h"
-#include "store/CXNetworkController.h"
+#include "store/account/CXNetworkController.h"
+#include "store/dav/CXDAVManager.h"
 
 #include <memory>
 #include <string>

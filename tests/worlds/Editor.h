@@ -2,7 +2,7 @@
 
 #include "Chance.h"
 #include "Report.h"
-#include "contacts/CXRolvane.h"
+#include "contacts/database/CXRolvane.h"
 
 #include <functional>
 #include <string>

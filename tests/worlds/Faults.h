@@ -2,7 +2,7 @@
 
 #include "Chance.h"
 #include "Report.h"
-#include "store/HttpTransport.h"
+#include "store/http/HttpTransport.h"
 
 #include <atomic>
 #include <map>

@@ -16,7 +16,7 @@ std::string othersName(const std::string& cell) {
 }
 
 // A labelled value is told apart by what it says. Two changes of one that did not know of each other stand side by side
-// (contacts/ContactMerge.h), and each goes when somebody replaces it.
+// (contacts/records/ContactMerge.h), and each goes when somebody replaces it.
 bool isLabelled(const std::string& cell) {
     return cell.starts_with("Phone/");
 }

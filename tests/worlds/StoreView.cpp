@@ -2,11 +2,11 @@
 
 #include "Editor.h"
 #include "conduits/PublishedLayout.h"
-#include "contacts/CXMultiValue.h"
-#include "contacts/Constants.h"
+#include "contacts/records/CXMultiValue.h"
+#include "contacts/records/Constants.h"
 #include "foundation/CXException.h"
 #include "foundation/PropertyList.h"
-#include "store/CXDAVManager.h"
+#include "store/dav/CXDAVManager.h"
 
 #include <algorithm>
 #include <array>

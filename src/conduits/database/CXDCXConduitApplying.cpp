@@ -1,0 +1,336 @@
+// Records of other sources, written into the contact database.
+
+#include "acl/CXDCXACLManager.h"
+#include "conduits/database/CXDCXConduit.h"
+#include "conduits/database/ContactWrites.h"
+#include "contacts/database/CXRolvane.h"
+#include "contacts/records/Constants.h"
+#include "contacts/records/ContactMerge.h"
+#include "contacts/records/Identifier.h"
+#include "foundation/Log.h"
+#include "foundation/PropertyList.h"
+#include "model/PayloadKeys.h"
+#include "model/RemoteLocationMap.h"
+
+#include <array>
+
+namespace rolvane {
+namespace {
+
+// The properties of which a group may have chosen a value, in the order in which the choices are written.
+constexpr std::array kChosenProperties{kCXAddressProperty, kCXEmailProperty, kCXPhoneProperty};
+
+// Bytes of content that may wait in memory for the end of the pass: some 50,000 contacts without photos.
+constexpr size_t kMostUnsaved = size_t{32} << 20;
+
+bool namesAllGroup(const CXDChangeRecord& record) {
+    return record.group() && cxUIDWithTableName(*record.group(), kCXGroupTable).str() == kCXAllGroupUID;
+}
+
+// The payload, read where it is delayed, and decoded for this one use where it stands encoded.
+Dictionary contentOf(CXDChangeRecord& record) {
+    if (const auto encoded = record.encodedPayload()) return BinaryValue::decode(*encoded).dictionary();
+    return record.payload().dictionary();
+}
+
+// A contact that could not be read, or whose record lost the way to its content in a stored queue, is known by its
+// stamp alone. Nothing in it says that the contact has become empty.
+bool saysNothing(const CXDChangeRecord& record, const Dictionary& content) {
+    if (record.delayedPayloadWasRead()) return false;
+    for (const auto& [property, value] : content)
+        if (property != kCXRemoteLocationProperty) return false;
+    return true;
+}
+
+} // namespace
+
+bool CXDCXConduit::applyChangeRecord(const CXDChangeRecordPtr& record, bool* /*denied*/) {
+    const bool done = dispatch(record);
+    // Most passes are one save. What is saved early is safe: applied again after a crash it changes nothing.
+    if (rolvane().unsavedSize() > kMostUnsaved) saveInThePass();
+    return done;
+}
+
+void CXDCXConduit::saveInThePass() {
+    engine().willSaveInThePass();
+    rolvane().save();
+}
+
+bool CXDCXConduit::dispatch(const CXDChangeRecordPtr& record) {
+    if (_readOnlyKillSwitch && record->user() == kSelf) {
+        CXDLog("kill switch caught bogus record: %@", record);
+        return true;
+    }
+    switch (record->type()) {
+    case CXDUpdateRecord: return updateRecord(record);
+    case CXDCreateStructureForGroup: return createStructureForGroup(record);
+    case CXDChangeGroupName: return changeGroupName(record);
+    case CXDAddRecordToGroup: return addRecordToGroup(record);
+    case CXDAddGroupToGroup: return addGroupToGroup(record);
+    case CXDChangeGroupReadACL: return changeGroupReadACL(record);
+    case CXDChangeGroupReadWriteACL: return changeGroupReadWriteACL(record);
+    case CXDUpdateDistributionList: return updateDistributionList(record);
+    case CXDRemoveRecordFromGroup: return removeRecordFromGroup(record);
+    case CXDRemoveGroupFromGroup: return removeGroupFromGroup(record);
+    case CXDDeleteRecord: return deleteRecord(record);
+    case CXDDeleteGroup: return deleteGroup(record);
+    default: return false;
+    }
+}
+
+// -- whose is it
+
+bool CXDCXConduit::mayChange(const CXDChangeRecord& record, const CXRecord& found) {
+    if (!record.user() || record.user() == kSelf) return true;
+    // A shared identifier finds the owner's own record when the copy is gone.
+    if (!found.isSubscribed()) return false;
+    const RemoteLocation location = found.remoteLocation();
+    if (syncSourceForRemoteLocation(location) == 0) return true; // nobody's in particular
+    const auto [known, isNew] = _publishers.try_emplace(location);
+    if (isNew) known->second = engine().userForRemoteLocation(location);
+    return known->second == record.user();
+}
+
+CXPersonRef CXDCXConduit::personOf(const CXDChangeRecord& record) {
+    if (!record.person()) return nullptr;
+    auto person = std::dynamic_pointer_cast<CXPerson>(recordForUniqueId(*record.person()));
+    return person && mayChange(record, *person) ? person : nullptr;
+}
+
+CXGroupRef CXDCXConduit::groupOf(const CXDChangeRecord& record) {
+    if (!record.group()) return nullptr;
+    auto group = std::dynamic_pointer_cast<CXGroup>(recordForUniqueId(*record.group()));
+    return group && mayChange(record, *group) ? group : nullptr;
+}
+
+CXGroupRef CXDCXConduit::subgroupOf(const CXDChangeRecord& record) {
+    if (!record.person()) return nullptr;
+    auto group = std::dynamic_pointer_cast<CXGroup>(recordForUniqueId(*record.person()));
+    return group && mayChange(record, *group) ? group : nullptr;
+}
+
+bool CXDCXConduit::hasUncapturedEdit(const UniqueId& uid) {
+    const int64_t now = rolvane().journalPosition();
+    if (now > _editsKnown) {
+        for (const UniqueId& changed : rolvane().changedByOthers(_editsKnown, now)) _uncaptured.insert(changed);
+        _editsKnown = now;
+    }
+    return _uncaptured.contains(uid);
+}
+
+bool CXDCXConduit::swallows(const CXDChangeRecord& record) const {
+    return _readOnlyKillSwitch && record.user() == kSelf && record.initialSource() != CXDSyncSourceCX;
+}
+
+bool CXDCXConduit::holds(const CXDChangeRecord& record) {
+    const auto isThere = [&] {
+        return (record.person() && _written.contains(*record.person())) || personOf(record) != nullptr;
+    };
+    switch (record.type()) {
+    case CXDAddRecordToGroup: return (namesAllGroup(record) || groupOf(record)) && isThere();
+    case CXDAddGroupToGroup: {
+        const CXGroupRef subgroup = subgroupOf(record);
+        if (!subgroup || namesAllGroup(record)) return subgroup != nullptr;
+        const CXGroupRef group = groupOf(record);
+        return group && group->mayListSubgroup(subgroup);
+    }
+    case CXDUpdateDistributionList:
+        // No choices are what everybody has who was not there.
+        return record.inMemoryPayload().dictionary().empty() || (groupOf(record) && isThere());
+    default: return true;
+    }
+}
+
+bool CXDCXConduit::waitsForWhatFollows(const CXDChangeRecord& record) {
+    if (record.type() != CXDAddGroupToGroup || namesAllGroup(record)) return false;
+    const CXGroupRef group = groupOf(record), subgroup = subgroupOf(record);
+    return group && subgroup && !group->mayListSubgroup(subgroup);
+}
+
+// -- people
+
+bool CXDCXConduit::updateRecord(const CXDChangeRecordPtr& record) {
+    if (!record->person()) return true;
+    const UniqueId& uid = *record->person();
+    CXPersonRef person = personOf(*record);
+    if (!person && recordForUniqueId(uid)) {
+        CXDLog("%@ names a record that is not its own; left as it is", record);
+        return true;
+    }
+    Dictionary content = contentOf(*record);
+    if (saysNothing(*record, content)) {
+        CXDLog("The content of %@ could not be read; the contact stays as it is", record);
+        return true;
+    }
+    if (!cxIsSubscribed(uid)) {
+        content = content.mutableCopy();
+        content.remove(kCXRemoteLocationProperty);
+        // The shared form may have found a copy. It stays where it came from, or no unsubscribing would take it away.
+        if (person && person->isSubscribed())
+            content.set(kCXRemoteLocationProperty, person->valueForProperty(kCXRemoteLocationProperty));
+    }
+    if (!person && hasUncapturedEdit(uid)) {
+        CXDLog("%@ has been deleted here meanwhile", record); // which is told to others after the pass
+        return true;
+    }
+    if (!person) {
+        person = CXPerson::initWithUniqueId(uid);
+        rolvane().addRecord(person);
+    }
+    takeIn(*record, *person, content);
+    _written.insert(uid);
+    return true;
+}
+
+// An edit that was not sent meets a version of somebody else's: nothing of either is lost. The edit waits in the queue,
+// is delivered after the pass, or is found by the next scan.
+void CXDCXConduit::takeIn(const CXDChangeRecord& record, CXPerson& person, const Dictionary& content) {
+    const auto common = rolvane().commonVersion(person.uniqueId());
+    const bool hasEdit = common ? common->properties != nullptr : hasUncapturedEdit(person.uniqueId());
+    if (!hasEdit) {
+        person.resetWithDictionary(content, true, false);
+        rolvane().setCommonVersion(person.uniqueId(), person.encodedRepresentation());
+        return;
+    }
+    const Dictionary ours = person.dictionaryRepresentation();
+    std::optional<Dictionary> base;
+    if (common) base = cxAsSent(BinaryValue::decode(*common->properties).dictionary());
+    person.resetWithDictionary(content, true, false); // what is not known goes
+    const auto theirs = person.encodedRepresentation();
+    const Dictionary there = BinaryValue::decode(*theirs).dictionary(), here = cxAsSent(ours);
+    CXMergeResult merge = mergedContact(base, here, there, CXSide::ours);
+    if (!merge.conflicts.empty()) {
+        CXDConduit* source = engine().conduitForSyncSource(record.initialSource());
+        const auto edited = common ? common->edited : std::optional(rolvane().personRow(person.uniqueId())->modified);
+        const auto written = source ? source->dateOfContact(record) : std::nullopt;
+        merge = mergedContact(base, here, there, laterSide(edited, written, here, there));
+    }
+    if (const Value& place = there[kCXRemoteLocationProperty]) merge.contact.set(kCXRemoteLocationProperty, place);
+    rolvane().noteConflicts(person.uniqueId(), merge.conflicts);
+    person.resetWithDictionary(merge.contact, true, false);
+    rolvane().setCommonVersion(person.uniqueId(), theirs);
+}
+
+bool CXDCXConduit::deleteRecord(const CXDChangeRecordPtr& record) {
+    if (const CXPersonRef person = personOf(*record)) rolvane().removeRecord(person);
+    return true;
+}
+
+// -- groups
+
+bool CXDCXConduit::createStructureForGroup(const CXDChangeRecordPtr& record) {
+    if (!record->group() || namesAllGroup(*record)) return true;
+    const UniqueId& uid = *record->group();
+    const CXGroupRef there = groupOf(*record);
+    if (!there && recordForUniqueId(uid)) {
+        CXDLog("%@ names a record that is not its own; left as it is", record);
+        return true;
+    }
+    const Dictionary content = contentOf(*record);
+    const CXGroupRef group = CXGroup::initWithUniqueId(uid);
+    if (cxIsSubscribed(uid)) group->setValue(content[kCXRemoteLocationProperty], kCXRemoteLocationProperty);
+    if (!group->setValue(content[kCXGroupNameProperty], kCXGroupNameProperty) && there)
+        group->setValue(Value(there->name()), kCXGroupNameProperty);
+    rolvane().addRecord(group);
+    saveInThePass();
+    return true;
+}
+
+bool CXDCXConduit::changeGroupName(const CXDChangeRecordPtr& record) {
+    if (namesAllGroup(*record)) return true;
+    if (const CXGroupRef group = groupOf(*record)) group->setValue(record->payload(), kCXGroupNameProperty);
+    return true;
+}
+
+bool CXDCXConduit::deleteGroup(const CXDChangeRecordPtr& record) {
+    const CXGroupRef group = namesAllGroup(*record) ? rolvane().allGroup() : groupOf(*record);
+    if (group) rolvane().removeRecord(group);
+    return true;
+}
+
+// -- membership
+
+bool CXDCXConduit::addRecordToGroup(const CXDChangeRecordPtr& record) {
+    if (namesAllGroup(*record)) return true; // every person is in it already
+    const CXPersonRef person = personOf(*record);
+    const CXGroupRef group = groupOf(*record);
+    if (person && group) group->addMember(person);
+    return true;
+}
+
+bool CXDCXConduit::addGroupToGroup(const CXDChangeRecordPtr& record) {
+    if (namesAllGroup(*record)) return true;
+    const CXGroupRef group = groupOf(*record);
+    const CXGroupRef subgroup = subgroupOf(*record);
+    if (!group || !subgroup) return true;
+    if (group->mayListSubgroup(subgroup))
+        group->addSubgroup(subgroup);
+    else
+        CXDLog("%@ would make a group contain itself", record); // see waitsForWhatFollows
+    return true;
+}
+
+bool CXDCXConduit::removeRecordFromGroup(const CXDChangeRecordPtr& record) {
+    const CXPersonRef person = personOf(*record);
+    if (!person) return true;
+    if (namesAllGroup(*record))
+        rolvane().removeRecord(person); // to leave the all-contacts group is to leave the database
+    else if (const CXGroupRef group = groupOf(*record))
+        group->removeMember(person);
+    return true;
+}
+
+bool CXDCXConduit::removeGroupFromGroup(const CXDChangeRecordPtr& record) {
+    const CXGroupRef subgroup = subgroupOf(*record);
+    if (!subgroup) return true;
+    if (namesAllGroup(*record))
+        rolvane().removeRecord(subgroup);
+    else if (const CXGroupRef group = groupOf(*record))
+        group->removeSubgroup(subgroup);
+    return true;
+}
+
+bool CXDCXConduit::updateDistributionList(const CXDChangeRecordPtr& record) {
+    const CXGroupRef group = groupOf(*record);
+    const CXPersonRef person = personOf(*record);
+    const Value payload = record->payload();
+    if (!group || !person || !payload) return true;
+    const Dictionary choices = payload.dictionary();
+    for (const char* property : kChosenProperties)
+        group->setDistributionIdentifier(choices[property].optionalString(), property, person);
+    return true;
+}
+
+// -- access lists
+
+// Who may read is the store's matter; the database keeps what its own user may do.
+bool CXDCXConduit::changeGroupReadACL(const CXDChangeRecordPtr& record) {
+    if (!namesAllGroup(*record)) groupOf(*record);
+    return true;
+}
+
+bool CXDCXConduit::changeGroupReadWriteACL(const CXDChangeRecordPtr& record) {
+    const CXDConduit* store = engine().conduitForSyncSource(record->initialSource());
+    const std::optional<Url> base = store ? store->baseLocationForUser(record->user()) : std::nullopt;
+    if (!base) return true;
+    const std::shared_ptr<CXACLManager> manager = ACLManagerForRemoteLocation(*base);
+    const UniqueId group = record->group().value_or(UniqueId());
+    const Dictionary differences = contentOf(*record);
+    for (const Value& principal : differences[kAdditions].array())
+        manager->grantReadWritePermissionForGUID(group, {}, UserName(principal.string()));
+    for (const Value& principal : differences[kDeletions].array())
+        manager->denyReadWritePermissionForGUID(group, {}, UserName(principal.string()));
+    return true;
+}
+
+// Looked up under the text of the location's base location and kept under the location's own: where the two differ,
+// every call makes another manager.
+std::shared_ptr<CXACLManager> CXDCXConduit::ACLManagerForRemoteLocation(const Url& location) {
+    if (auto known = CXDConduit::ACLManagerForRemoteLocation(location)) return known;
+    auto manager =
+        std::make_shared<CXDCXACLManager>(location, engine(), rolvane(), realUserFromUser(kSelf).value_or(kSelf));
+    (*_ACLManagerMap)[location.absoluteString()] = manager;
+    return manager;
+}
+
+} // namespace rolvane

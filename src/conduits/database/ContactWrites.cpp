@@ -1,0 +1,118 @@
+#include "conduits/database/ContactWrites.h"
+
+#include "conduits/store/CXDVaultraConduit.h"
+#include "contacts/records/Constants.h"
+#include "contacts/records/ContactMerge.h"
+#include "contacts/records/Identifier.h"
+#include "foundation/Log.h"
+#include "foundation/PropertyList.h"
+#include "model/PayloadKeys.h"
+#include "store/dav/CXDAVManager.h"
+
+#include <utility>
+
+namespace rolvane {
+namespace {
+
+constexpr int kOk = 200;
+constexpr int kForbidden = 403;
+constexpr int kChangedMeanwhile = 412;
+constexpr int kAttempts = 4;
+
+Dictionary withoutLocation(const Dictionary& contact) {
+    Dictionary rest = contact.mutableCopy();
+    rest.remove(kCXRemoteLocationProperty);
+    return rest;
+}
+
+std::shared_ptr<const Bytes> encoded(const Dictionary& contact) {
+    return std::make_shared<const Bytes>(BinaryValue::encode(contact));
+}
+
+} // namespace
+
+Dictionary cxAsSent(const Dictionary& contact) {
+    return PropertyList::fromXML(PropertyList::toXML(contact)).dictionary();
+}
+
+bool ContactWrites::put(const Place& place, const Dictionary& content, int& code) {
+    return _manager.write(PropertyList::toXML(content), place.location, CXDVaultraConduit::kSecureRecordWrites, &code);
+}
+
+bool ContactWrites::write(const Place& place, const Dictionary& ours, int& code) {
+    bool done = false;
+    // A contact that no store is known to have had is written as it is.
+    if (!place.merges || (!_rolvane.commonVersion(place.uniqueId) && !_manager.remembersVersion(place.location))) {
+        done = put(place, ours, code);
+    } else {
+        for (int attempt = 0; attempt < kAttempts && !done; ++attempt) {
+            const auto there = _manager.readVersion(place.location, CXDVaultraConduit::kSecureRecordWrites, &code);
+            if (there.failed) return false;
+            const bool isKnown = !there.contact || there.isKnown;
+            if (!there.contact)
+                done = writeWhereNoneIs(place, ours, code);
+            else
+                done = isKnown ? put(place, ours, code)
+                               : writeMerged(place, ours, *there.contact, there.lastModified, code);
+            if (!done && !isKnown) _manager.forgetVersion(place.location); // it was read, and nobody has it
+            if (!done && code != kChangedMeanwhile) return false;
+        }
+    }
+    if (done) _rolvane.setCommonVersion(place.uniqueId, encoded(ours));
+    return done;
+}
+
+// The list of everybody says whether the store has lost the file or somebody has deleted the contact. Without the list
+// the edit waits.
+bool ContactWrites::writeWhereNoneIs(const Place& place, const Dictionary& ours, int& code) {
+    if (place.wasListed && place.wasListed()) {
+        const auto list = _manager.dictionaryAtURL(place.list, CXDVaultraConduit::kSecureRecordWrites, &code);
+        const Value members = list ? (*list)[kMemberUIDState] : Value();
+        if (!members.isArray()) {
+            if (code == kForbidden) code = 0; // a refusal of the question is none of the edit
+            return false;
+        }
+        if (!members.array().containsString(cxNormalizedUID(place.uniqueId).str())) {
+            CXLog("%@ has been deleted by somebody else, and is not written any more", place.location);
+            _manager.forgetVersion(place.location);
+            return true;
+        }
+    }
+    return put(place, ours, code);
+}
+
+bool ContactWrites::writeMerged(const Place& place, const Dictionary& ours, const Dictionary& theirs,
+                                const std::optional<Date>& theirDate, int& code) {
+    const auto common = _rolvane.commonVersion(place.uniqueId);
+    const Dictionary here = withoutLocation(cxAsSent(ours)), there = withoutLocation(theirs);
+    std::optional<Dictionary> base;
+    if (common) // not edited since: the own content is what both had
+        base = common->properties ? cxAsSent(BinaryValue::decode(*common->properties).dictionary()) : here;
+    const CXSide later = laterSide(common ? common->edited : std::nullopt, theirDate, here, there);
+    CXMergeResult merge = mergedContact(base, here, there, later);
+    CXDLog("%@ has been changed by somebody else, too: merged", place.location);
+    _rolvane.noteConflictsAtOnce(place.uniqueId, merge.conflicts);
+    bool done = merge.contact == there;
+    code = kOk;
+    if (!done) {
+        Dictionary content = merge.contact.mutableCopy();
+        if (const Value& location = ours[kCXRemoteLocationProperty]) content.set(kCXRemoteLocationProperty, location);
+        done = put(place, content, code);
+    }
+    if (done && merge.contact != here) {
+        const std::lock_guard guard(_lock);
+        _merged.push_back({place, merge.contact});
+    }
+    return done;
+}
+
+std::vector<ContactWrites::Merged> ContactWrites::takeMerged() {
+    const std::lock_guard guard(_lock);
+    return std::exchange(_merged, {});
+}
+
+void ContactWrites::giveUpMerged() {
+    for (const Merged& each : takeMerged()) _manager.forgetVersion(each.place.location);
+}
+
+} // namespace rolvane

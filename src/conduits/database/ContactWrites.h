@@ -1,0 +1,69 @@
+#pragma once
+
+#include "contacts/database/CXRolvane.h"
+#include "foundation/Url.h"
+#include "foundation/Value.h"
+#include "model/CXDChangeRecord.h"
+
+#include <functional>
+#include <mutex>
+#include <optional>
+#include <vector>
+
+namespace rolvane {
+
+class CXDAVManager;
+
+// The contact as it comes back from a store: dates to the second, for instance.
+Dictionary cxAsSent(const Dictionary& contact);
+
+// Writes edited contacts into trees that others write to, too. A version that the client does not know is merged with
+// the own one (contacts/records/ContactMerge.h) before it is written over, and only the version that was read is
+// written over.
+//
+// Steps of one write, and what a process that is killed behind each of them leaves:
+//   read the store's version    nothing
+//   note the conflicts          the note, which is not made twice
+//   write the merged contact    the edit still waits; merged again with its own result it gives that result
+//   tell the database           the common version is as old as before: the same
+// Any thread.
+class ContactWrites {
+public:
+    // Both borrowed.
+    ContactWrites(CXDAVManager& manager, CXRolvane& rolvane) : _manager(manager), _rolvane(rolvane) {}
+
+    struct Place {
+        UserName user;                   // of the tree
+        Url location;                    // of the contact's file
+        UniqueId uniqueId;               // of the contact in the database
+        bool merges;                     // others may have written there, and what they wrote may be taken in here
+        Url list;                        // the tree's list of everybody
+        std::function<bool()> wasListed; // whether that list is known to have named the contact; asked at most once
+    };
+    // True when the store has the content afterwards, alone or merged, and when somebody else has deleted the contact:
+    // its file is gone and the list that named it does not any more. `code`: the last answer's status; 412 when
+    // somebody else was faster several times.
+    bool write(const Place& place, const Dictionary& ours, int& code);
+
+    // Contacts that were merged since the last call; the database has to take them in.
+    struct Merged {
+        Place place;
+        Dictionary contact;
+    };
+    std::vector<Merged> takeMerged();
+    // Merged contacts that nobody has taken count as not seen yet.
+    void giveUpMerged();
+
+private:
+    bool put(const Place& place, const Dictionary& content, int& code);
+    bool writeWhereNoneIs(const Place& place, const Dictionary& ours, int& code);
+    bool writeMerged(const Place& place, const Dictionary& ours, const Dictionary& theirs,
+                     const std::optional<Date>& theirDate, int& code);
+
+    CXDAVManager& _manager;
+    CXRolvane& _rolvane;
+    std::mutex _lock;
+    std::vector<Merged> _merged; // guarded by _lock
+};
+
+} // namespace rolvane

@@ -1,0 +1,210 @@
+#include "conduits/store/CXDVaultraConduit.h"
+
+#include "conduits/LocalizedText.h"
+#include "conduits/PublishedLayout.h"
+#include "conduits/UserAlert.h"
+#include "conduits/store/StoreComparison.h"
+#include "contacts/database/CXRolvane.h"
+#include "foundation/CXException.h"
+#include "foundation/Log.h"
+#include "foundation/Preferences.h"
+#include "model/PayloadKeys.h"
+#include "model/RemoteLocationMap.h"
+#include "store/account/CXNetworkController.h"
+#include "store/dav/CXDAVManager.h"
+
+#include <future>
+#include <mutex>
+#include <utility>
+
+namespace rolvane {
+
+CXDVaultraConduit::CXDVaultraConduit(ConduitEngine& engine, World world)
+    : CXDConduit(engine), _world(std::move(world)) {
+    _simulated = _world.distributed.observe(
+        "SimulateVaultraNotification", [this](const Notification&) { vaultraSynced(); }, true);
+    _networkChanged = _world.notifications.observe(kCXNetworkConfigurationDidChangeNotification,
+                                                   [this](const Notification&) { networkChanged(); });
+}
+
+CXDVaultraConduit::~CXDVaultraConduit() {
+    awaitStructure();
+    if (_serverDate.valid()) _serverDate.wait();
+}
+
+std::optional<std::string> CXDVaultraConduit::conduitID() const {
+    return kConduitVaultra;
+}
+
+std::optional<UserName> CXDVaultraConduit::realUserFromUser(const std::optional<UserName>& user) const {
+    return user == kSelf ? _world.manager.account().user : user;
+}
+
+int32_t CXDVaultraConduit::conduitSource() const {
+    return CXDSyncSourceVaultra;
+}
+
+CXFileManager* CXDVaultraConduit::defaultManager() const {
+    return &_world.manager;
+}
+
+std::optional<Url> CXDVaultraConduit::baseLocationForUser(const std::optional<UserName>& user) const {
+    if (!user) return std::nullopt;
+    const std::lock_guard guard(_basesLock);
+    const auto [found, isNew] = _bases.try_emplace(*user);
+    if (isNew) found->second = _world.manager.account().baseLocationFor(*user);
+    return found->second;
+}
+
+std::optional<Url> CXDVaultraConduit::baseLocationOf(const CXDChangeRecord& record) const {
+    return baseLocationForUser(realUserFromUser(record.user()));
+}
+
+// -- reachability and the pass's frame
+
+int CXDVaultraConduit::testReachability(const std::function<void()>& meanwhile) {
+    CXDAVError error;
+    const std::vector<std::string> origins = _world.manager.account().origins();
+    const std::string address = origins.empty() ? "" : Url(origins.front() + "/").host();
+    // Without a route nobody is asked, so nobody can refuse the password either.
+    const bool routed = _world.network.canReachAddress(address);
+    if (!routed) error = {0, "There is no network."};
+    const bool online = routed && _world.manager.canReach(error, meanwhile);
+    _vaultraOffLine = !online;
+    engine().storeWasTested(online, online ? 0 : error.code, online ? std::string() : error.reason);
+    CXDLog("Vaultra is %@", online ? "online" : "offline");
+    return error.code;
+}
+
+// What a gathering asks first of a subscribed tree goes along with the test of the store and the login.
+void CXDVaultraConduit::beginReading() {
+    for (const CXSubscriptionRef& subscription : _world.rolvane.subscriptions()) {
+        const RemoteLocation location = subscription->remoteLocation();
+        if (syncSourceForRemoteLocation(location) != conduitSource()) continue;
+        const UserName user = engine().userForRemoteLocation(location);
+        const auto base = user.empty() || user == kSelf ? std::nullopt : baseLocationForUser(user);
+        if (!base) continue;
+        _world.manager.expectSomeReads({base->cxURLByAppendingComponent(layout::kInfo)}, false);
+        _world.manager.expectListing(*base);
+        return; // a wrong password is not to be offered many times
+    }
+}
+
+// A gathering reads a tree of which something is known, and finds it whole then.
+void CXDVaultraConduit::lookAfterStructure(bool meanwhile) {
+    awaitStructure();
+    if (!meanwhile) {
+        sanityCheckPublishStructure();
+        return;
+    }
+    const std::lock_guard guard(_structureLock);
+    _structure = std::async(std::launch::async, [this] {
+        try {
+            sanityCheckPublishStructure();
+        } catch (const CXException& exception) {
+            CXLog("The published tree could not be looked after: %@", exception);
+        }
+    });
+}
+
+void CXDVaultraConduit::awaitStructure() {
+    const std::lock_guard guard(_structureLock);
+    if (_structure.valid()) _structure.get();
+}
+
+void CXDVaultraConduit::open() {
+    const bool gathering = std::exchange(_gathering, false);
+    if (_serverDate.valid()) _serverDate.wait(); // of a pass that failed
+    _serverDate = {};
+    _world.manager.expectNothing();
+    _writes.giveUpMerged(); // of a pass that failed
+    _setBack.clear();
+    _publishesAgain = !engine().conduitObjectForKey(kConduitCX, kPublishAgain).empty();
+    const int code = testReachability(gathering ? [this] { beginReading(); } : std::function<void()>());
+    if (code == kCXDAVErrorAuthentication) {
+        if (shouldWarnUserAboutUserNameOrPassword()) {
+            CXDLog("Username or password is incorrect. Displaying visual warning");
+            warnUserAboutUserNameOrPassword();
+        } else {
+            CXDLog("Username or password is incorrect. No visual warning");
+        }
+        engine().cancel();
+    }
+    _lastSyncDate = _world.preferences.get(kDaemonDomain, kLastSyncDateKey).date().value_or(Date::distantPast());
+    if (_vaultraOffLine) return;
+    _isWrittenByOthers = somebodyMayWrite();
+    forgetSubscribersRights();
+    const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
+    _world.manager.keepSerialNumber(users[kSelf.str()].dictionary()[kSerialNumber].string());
+    lookAfterStructure(gathering && !users.contains(kSelf.str()));
+}
+
+void CXDVaultraConduit::willClose() {
+    const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
+    if (_vaultraOffLine || _serverDate.valid() || users.contains(kSelf.str()) || isToBePublishedAgain()) return;
+    _serverDate = std::async(std::launch::async, [this] { return currentServerDate(); });
+}
+
+void CXDVaultraConduit::close() {
+    CXDConduit::close();
+    awaitStructure();
+    _world.manager.expectNothing();
+    if (_vaultraOffLine) return;
+    _world.manager.saveVersionMemory();
+    if (isToBePublishedAgain()) return;
+    std::optional<Date> now = _serverDate.valid() ? _serverDate.get() : std::nullopt;
+    if (!now) now = currentServerDate();
+    CXDLog("Closing, last sync: %@", now);
+    // A store that went away during the pass tells no date: keeping the old one costs reads, a guessed one loses edits.
+    if (!now) return;
+    _lastSyncDate = now;
+    _world.preferences.set(kDaemonDomain, kLastSyncDateKey, *now);
+    _world.preferences.synchronize(kDaemonDomain);
+}
+
+std::optional<Date> CXDVaultraConduit::currentServerDate() {
+    awaitStructure();
+    const auto base = baseLocationForUser(realUserFromUser(kSelf));
+    if (!base) return std::nullopt;
+    const Url dateFile = layout::dateFileLocation(*base);
+    _world.manager.write(std::string(layout::kClockText), dateFile, false);
+    return _world.manager.modDateForURL(dateFile);
+}
+
+bool CXDVaultraConduit::sanityCheckPublishStructure() {
+    return _world.manager.sanityCheckPublishStructureCreate(true);
+}
+
+void CXDVaultraConduit::networkChanged() {
+    CXDLog("Network changed");
+    _world.manager.networkChanged();
+    testReachability();
+    if (!_vaultraOffLine) engine().bringSourcesUpToDate();
+}
+
+void CXDVaultraConduit::vaultraSynced() {
+    engine().bringSourcesUpToDate();
+}
+
+bool CXDVaultraConduit::shouldWarnUserAboutUserNameOrPassword() const {
+    const auto last = _world.preferences.get(kDaemonDomain, kLastWarningDateKey).date();
+    return !last || _world.clock.now().secondsSince(*last) > kWarningInterval;
+}
+
+void CXDVaultraConduit::warnUserAboutUserNameOrPassword() {
+    UserAlert::Text text;
+    text.header = localizedText("SHARING_BAD_USERNAME_PASS_HEADER");
+    text.message = localizedText("SHARING_BAD_USERNAME_PASS");
+    text.defaultButton = localizedText("OK");
+    text.icon = "Rolvane";
+    _world.alert.show(text);
+    _world.preferences.set(kDaemonDomain, kLastWarningDateKey, _world.clock.now());
+    _world.preferences.synchronize(kDaemonDomain);
+}
+
+Dictionary CXDVaultraConduit::currentState() {
+    const CXDAVManager::Snapshot unchangedGroupsAreNotFetched(_world.manager);
+    return CXDConduit::currentState();
+}
+
+} // namespace rolvane

@@ -1,0 +1,174 @@
+#pragma once
+
+#include "conduits/CXDConduit.h"
+#include "conduits/database/ContactWrites.h"
+#include "foundation/Notification.h"
+
+#include <atomic>
+#include <functional>
+#include <future>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <set>
+#include <string>
+#include <unordered_map>
+
+namespace rolvane {
+
+class CXDAVManager;
+class CXNetworkController;
+class CXRolvane;
+class Clock;
+class Preferences;
+class UserAlert;
+
+// Makes the access-list manager of a base location. Exists so that tests can replace it.
+using ACLManagerFactory =
+    std::function<std::shared_ptr<CXACLManager>(const Url& baseLocation, const LocationOwner& owner)>;
+
+// The conduit of the network store: applies change records to the tree of the record's user on the WebDAV store, and
+// knows whether the store can be used at all.
+//
+// Threads: workers call applyChangeRecordIfNeeded side by side for records other than access-list changes; everything
+// else, access-list changes included, comes on the main thread while no worker runs.
+class CXDVaultraConduit : public CXDConduit {
+public:
+    static constexpr const char* kLastSyncDateKey = "CXDVaultraConduitLastSyncDate";
+    static constexpr const char* kLastWarningDateKey = "CXDLastUserPasswordWarningDate";
+    // What no save of the owner's access list has carried yet: base location to what the manager gives as unsaved.
+    // Written with the queue, so that another process goes on with it.
+    static constexpr const char* kUnsavedAccessListsKey = "CXDUnsavedAccessLists";
+    static constexpr double kWarningInterval = 900;   // seconds between two password warnings
+    static constexpr bool kSecureRecordWrites = true; // contact records, group states and new groups' "info"
+
+    // All borrowed; they outlive the conduit.
+    struct World {
+        CXDAVManager& manager;
+        CXNetworkController& network;
+        Preferences& preferences;
+        Clock& clock;
+        NotificationCenter& notifications;     // this process's: the network's changes
+        DistributedNotifications& distributed; // the user's processes': "SimulateVaultraNotification"
+        UserAlert& alert;
+        CXRolvane& rolvane;
+        ACLManagerFactory makeACLManager = {};   // none: a CXDAVACLManager on the client
+        WithdrawalNotice* withdrawals = nullptr; // none: nothing is kept and nobody is told
+    };
+
+    CXDVaultraConduit(ConduitEngine& engine, World world);
+    ~CXDVaultraConduit() override;
+
+    std::optional<std::string> conduitID() const override;
+    // "<self>" is the account's user; any other user stays.
+    std::optional<UserName> realUserFromUser(const std::optional<UserName>& user) const override;
+    int32_t conduitSource() const override;
+    CXFileManager* defaultManager() const override;
+    std::optional<Url> baseLocationForUser(const std::optional<UserName>& user) const override;
+    // False: the change was not made and stays pending; *denied: the store refused it with 403. Off line, and without
+    // the lock of the tree, nothing is sent.
+    using CXDConduit::applyChangeRecord;
+    bool applyChangeRecord(const CXDChangeRecordPtr& record, bool* denied) override;
+    void wasRefused(const CXDChangeRecord& record) override;
+    CXDChangeRecords takeMerged() override;
+    std::optional<Date> dateOfContact(const CXDChangeRecord& record) override;
+    void willGather() override { _gathering = true; }
+    // A refused user name or password warns the person, at most once in 15 minutes, and ends the daemon. In a
+    // gathering the structure of a tree of which nothing is known is looked after while the pass goes on; what needs it
+    // waits.
+    void open() override;
+    // Asks for the server's date in advance, where the owner publishes nothing that is locked and written meanwhile.
+    void willClose() override;
+    // The stored last-sync date moves to the server's date; off line, or when the server does not tell it, it stays.
+    void close() override;
+    // The map's manager, else a new one for the location's base location, which the map then keeps. None when the
+    // location has no base location.
+    std::shared_ptr<CXACLManager> ACLManagerForRemoteLocation(const Url& location) override;
+
+    // As the base's; also the lists that an earlier process could not save. What is left is noted, without
+    // synchronising.
+    bool saveACLs() override;
+
+    // As the base's, and what an older copy of the owner's tree has brought back on the store.
+    CXDChangeRecords changeRecords() override;
+    // As the base's, with every group file that has not changed since it was read last taken from the client's memory.
+    Dictionary currentState() override;
+
+    bool vaultraOffLine() const { return _vaultraOffLine; }
+    // Touches the owner's clock file and asks for its date; nothing when the store does not answer.
+    std::optional<Date> currentServerDate();
+    bool sanityCheckPublishStructure();
+    bool lockStructureForRecord(const CXDChangeRecord& record); // any thread
+
+    void networkChanged();
+    void vaultraSynced();
+    bool shouldWarnUserAboutUserNameOrPassword() const;
+    void warnUserAboutUserNameOrPassword();
+
+protected:
+    CXRolvane& database() const override { return _world.rolvane; }
+    Preferences& preferences() const override { return _world.preferences; }
+    bool keepsAccessLists() const override; // as the server announces it
+    WithdrawalNotice* withdrawalNotice() const override { return _world.withdrawals; }
+    // Sends what waits for the lists, tells the person and leaves a note.
+    void ownPublicationEnds(const Url& base, bool replaced) override;
+    // A tree that was set back or has lost its lists says nothing about anybody's contacts, and is left alone. The
+    // owner's own is published again.
+    bool isTrusted(const UserName& user, const Dictionary& state) override;
+
+private:
+    void beginReading();
+    void lookAfterStructure(bool meanwhile); // while the pass goes on
+    void awaitStructure();                   // any thread
+    void publishAgain();
+    void restoreAccessLists();
+    bool isMended(const Dictionary& prior, const Dictionary& state);
+    bool isToBePublishedAgain();
+    void mendOwnTree(const Dictionary& prior, const Dictionary& state);
+    void takeNamesAloneOut(Dictionary prior, const Dictionary& state);
+    bool somebodyMayWrite(); // besides the owner
+    bool allGroupHas(const char* property);
+    void leaveUnlistedOut(CXDChangeRecords& records);
+    void forgetSubscribersRights();
+    void noteUnsavedAccessLists();
+    // Sets _vaultraOffLine; the error's code, 0 when there was none. `meanwhile`: as of CXDAVManager::canReach.
+    int testReachability(const std::function<void()>& meanwhile = {});
+    std::optional<Url> baseLocationOf(const CXDChangeRecord& record) const;
+
+    bool mayBeNamed(const CXDChangeRecordPtr& record); // else it is refused for good
+    // Each writes one kind of change and sets the result code to the last request's HTTP status.
+    bool apply(CXDChangeRecord& record, int& code);
+    bool updateRecord(CXDChangeRecord& record, int& code);
+    UniqueId inDatabase(const CXDChangeRecord& record);
+    void forgetEdit(const CXDChangeRecord& record);
+    bool mergesInto(const UserName& user);
+    bool createStructureForGroup(CXDChangeRecord& record, int& code);
+    bool makeCompositeGroupChange(CXDChangeRecord& record, int& code);
+    bool wasDeletedThere(CXDChangeRecord& record);
+    Dictionary lastKnownState(const CXDChangeRecord& record);
+    bool changeGroupName(CXDChangeRecord& record, int& code);
+    bool addRecordToGroup(CXDChangeRecord& record, int& code);
+    bool deleteRecord(CXDChangeRecord& record, int& code);
+    bool deleteGroup(CXDChangeRecord& record, int& code);
+    bool changeGroupReadACL(CXDChangeRecord& record);
+    bool changeGroupReadWriteACL(CXDChangeRecord& record);
+
+    World _world;
+    ContactWrites _writes{_world.manager, _world.rolvane};
+    std::atomic<bool> _vaultraOffLine = false;
+    std::atomic<bool> _isWrittenByOthers = false; // the own tree, as of the last open
+    std::atomic<bool> _publishesAgain = false;    // the own tree: it is older than the database
+    std::set<UserName> _setBack;                  // other trees that are, as this pass has seen; main thread
+    CXDChangeRecords _leftovers;                  // of the gathering that is under way
+    std::map<UserName, Dictionary> _read;         // so far: the states of known users
+    bool _gathering = false;                      // `open` belongs to a gathering
+    std::mutex _structureLock;
+    std::future<void> _structure; // the look at the own tree that is under way; guarded by _structureLock
+    // The account is the manager's for good, and every record asks for its user's base location several times.
+    std::future<std::optional<Date>> _serverDate; // asked for in advance
+    mutable std::mutex _basesLock;
+    mutable std::unordered_map<UserName, Url> _bases; // guarded by _basesLock
+    ObservationHandle _simulated, _networkChanged;
+};
+
+} // namespace rolvane

@@ -1,0 +1,232 @@
+// The part of the network store's conduit that writes: one function for each kind of change record.
+
+#include "conduits/store/CXDVaultraConduit.h"
+
+#include "conduits/PublishedLayout.h"
+#include "contacts/database/CXRolvane.h"
+#include "contacts/records/Constants.h"
+#include "contacts/records/Identifier.h"
+#include "foundation/Log.h"
+#include "foundation/PropertyList.h"
+#include "model/PayloadKeys.h"
+#include "model/RemoteLocationMap.h"
+#include "store/dav/CXDAVManager.h"
+
+#include <utility>
+
+namespace rolvane {
+namespace {
+
+constexpr int kOk = 200;
+constexpr int kForbidden = 403;
+constexpr int kMissing = 404;
+
+// The payload, decoded for this one use where it stands encoded: the record keeps no tree of it.
+Dictionary contentOf(CXDChangeRecord& record) {
+    if (const auto encoded = record.encodedPayload()) return BinaryValue::decode(*encoded).dictionary();
+    return record.payload().dictionary();
+}
+
+} // namespace
+
+bool CXDVaultraConduit::lockStructureForRecord(const CXDChangeRecord& record) {
+    awaitStructure();
+    const auto base = baseLocationOf(record);
+    return base && engine().lockURL(layout::dateFileLocation(*base));
+}
+
+bool CXDVaultraConduit::applyChangeRecord(const CXDChangeRecordPtr& record, bool* denied) {
+    if (denied) *denied = false;
+    if (_vaultraOffLine || !lockStructureForRecord(*record)) return false;
+    int code = 0;
+    const bool applied = mayBeNamed(record) ? apply(*record, code) : true;
+    if (denied) *denied = code == kForbidden;
+    return applied;
+}
+
+void CXDVaultraConduit::wasRefused(const CXDChangeRecord& record) {
+    const bool isContact = record.type() == CXDUpdateRecord || record.type() == CXDDeleteRecord;
+    const auto base = baseLocationOf(record);
+    const bool isEdit = record.type() == CXDUpdateRecord && record.initialSource() == CXDSyncSourceCX;
+    if (isEdit && record.person() && !record.changeMadeByDataOwner()) forgetEdit(record);
+    if (isContact && base && record.person())
+        _world.manager.forgetVersion(layout::contactLocation(*base, cxNormalizedUID(*record.person())));
+}
+
+// The store will never take this edit, so its version must not be merged with the edit.
+void CXDVaultraConduit::forgetEdit(const CXDChangeRecord& record) {
+    const UniqueId uid = inDatabase(record);
+    if (const auto row = _world.rolvane.personRow(uid)) _world.rolvane.setCommonVersion(uid, row->encoded);
+}
+
+// Identifiers also come out of other people's lists: one that names the tree's own files would destroy those. What has
+// such a name stays where it is, and its change does not wait for ever.
+bool CXDVaultraConduit::mayBeNamed(const CXDChangeRecordPtr& record) {
+    for (const auto& name : {record->person(), record->group()}) {
+        if (!name || layout::isARecordsName(*name)) continue;
+        CXLog("\"%@\" is a name of the published tree's own, and no contact or group can be kept under it. The change "
+              "stays in this database: %@",
+              *name, record->description());
+        engine().noteRefused({record->user().value_or(UserName()), kRefusedForItsName});
+        if (record->type() == CXDUpdateRecord && record->person()) forgetEdit(*record);
+        return false;
+    }
+    return true;
+}
+
+bool CXDVaultraConduit::apply(CXDChangeRecord& record, int& code) {
+    switch (record.type()) {
+    case CXDUpdateRecord: return updateRecord(record, code);
+    case CXDCreateStructureForGroup: return createStructureForGroup(record, code);
+    case CXDCompositeGroupChange: return makeCompositeGroupChange(record, code);
+    case CXDChangeGroupName: return changeGroupName(record, code);
+    case CXDAddRecordToGroup: return addRecordToGroup(record, code);
+    case CXDChangeGroupReadACL: return changeGroupReadACL(record);
+    case CXDChangeGroupReadWriteACL: return changeGroupReadWriteACL(record);
+    case CXDRemoveRecordFromGroup: return true; // markers stay on the network store
+    case CXDDeleteRecord: return deleteRecord(record, code);
+    case CXDDeleteGroup: return deleteGroup(record, code);
+    default: return false;
+    }
+}
+
+bool CXDVaultraConduit::updateRecord(CXDChangeRecord& record, int& code) {
+    const auto base = baseLocationOf(record);
+    if (!base || !record.person()) return false;
+    const UserName user = record.user().value_or(UserName());
+    const UniqueId shared = cxNormalizedUID(*record.person()), everybody{std::string(layout::kAllGroup)};
+    const ContactWrites::Place place{user,
+                                     layout::contactLocation(*base, *record.person()),
+                                     inDatabase(record),
+                                     mergesInto(user),
+                                     layout::groupLocation(*base, everybody),
+                                     [&] {
+                                         const Dictionary list =
+                                             engine().knownGroupState(kConduitVaultra, user, everybody);
+                                         return list[kMemberUIDState].array().containsString(shared.str());
+                                     }};
+    return _writes.write(place, contentOf(record), code);
+}
+
+// A shared identifier means the owner's own contact in the own tree, and in another one the copy that came from there,
+// also when somebody has deleted that meanwhile.
+UniqueId CXDVaultraConduit::inDatabase(const CXDChangeRecord& record) {
+    const UniqueId own = cxUIDWithTableName(*record.person(), kCXPersonTable);
+    if (record.changeMadeByDataOwner()) return own;
+    return cxUIDWithTableName(own, kCXSubscribedPersonTable);
+}
+
+// Where nobody else writes there is nothing to merge with. What an older copy of a tree holds is no news.
+bool CXDVaultraConduit::mergesInto(const UserName& user) {
+    if (user == kSelf) return _isWrittenByOthers && !_publishesAgain;
+    return !_setBack.contains(user);
+}
+
+CXDChangeRecords CXDVaultraConduit::takeMerged() {
+    CXDChangeRecords updates;
+    for (const ContactWrites::Merged& merged : _writes.takeMerged()) {
+        if (!_world.rolvane.personRow(merged.place.uniqueId)) continue; // deleted meanwhile, and so it stays
+        Dictionary content = merged.contact.mutableCopy();
+        const auto base = baseLocationForUser(realUserFromUser(merged.place.user));
+        if (merged.place.user != kSelf && base)
+            stampWithRemoteLocation(content, RemoteLocation(base->absoluteString()));
+        auto update = std::make_shared<CXDChangeRecord>(conduitSource(), CXDUpdateRecord, merged.place.user,
+                                                        merged.place.uniqueId, std::nullopt, std::move(content));
+        update->setAppliesToSources(CXDSyncSourceCX);
+        updates.push_back(std::move(update));
+    }
+    return updates;
+}
+
+std::optional<Date> CXDVaultraConduit::dateOfContact(const CXDChangeRecord& record) {
+    const auto base = baseLocationOf(record);
+    if (_vaultraOffLine || !base || !record.person()) return std::nullopt;
+    return _world.manager.modDateForURL(layout::contactLocation(*base, cxNormalizedUID(*record.person())));
+}
+
+bool CXDVaultraConduit::createStructureForGroup(CXDChangeRecord& record, int& code) {
+    const auto base = baseLocationOf(record);
+    if (!base || !record.group()) return false;
+    // Whether the directory could be made shows in the write below it.
+    _world.manager.createDirectoryAtAURL(layout::groupLocation(*base, *record.group()));
+    return _world.manager.write(stringForDictionary(contentOf(record)),
+                                layout::groupInfoLocation(*base, *record.group()), kSecureRecordWrites, &code);
+}
+
+bool CXDVaultraConduit::makeCompositeGroupChange(CXDChangeRecord& record, int& code) {
+    const auto base = baseLocationOf(record);
+    if (!base || !record.group()) return false;
+    const Url location = layout::groupLocation(*base, *record.group());
+    auto state = _world.manager.dictionaryAtURL(location, false, &code);
+    if (!state && code == kMissing) {
+        const bool isList = record.group()->str() == layout::kAllGroup;
+        if (isList && !record.changeMadeByDataOwner()) return false; // it waits for its owner's
+        if (wasDeletedThere(record)) return true;
+    }
+    // A part alone would be taken for all of it.
+    if (!state && (code == kMissing || code == kOk)) state = lastKnownState(record);
+    const Dictionary changed = layout::groupStateAfterComposite(state.value_or(Dictionary()), contentOf(record));
+    // A state that is there and could not be read is not replaced by a part of it: the client then sends no write, and
+    // the answer to the read stands.
+    int written = 0;
+    const bool done = _world.manager.write(stringForDictionary(changed), location, kSecureRecordWrites, &written);
+    if (written != 0) code = written;
+    return done;
+}
+
+// A group that is known and whose state is gone, asked twice: somebody else who may write has deleted it, and a part of
+// it would bring it back without its name and members. The change is given up. Where the store has lost the state of an
+// own group, the next look at the tree finds that out, and all of it is published again.
+bool CXDVaultraConduit::wasDeletedThere(CXDChangeRecord& record) {
+    if (!record.user() || !record.group() || (record.changeMadeByDataOwner() && !_isWrittenByOthers)) return false;
+    const Dictionary known = engine().knownGroupState(kConduitVaultra, *record.user(), *record.group());
+    if (known.empty()) return false;
+    int code = 0;
+    const Url location = layout::groupLocation(*baseLocationOf(record), *record.group());
+    if (_world.manager.dictionaryAtURL(location, false, &code) || code != kMissing) return false;
+    if (record.group()->str() == layout::kAllGroup) return true; // it will be seen that the tree has lost its lists
+    CXLog("The group has been deleted by somebody else, and is not changed any more: %@", record.description());
+    engine().noteRefused({*record.user(), kRefusedAsGroupIsGone, known[kCXGroupNameProperty].string()});
+    return true;
+}
+
+// In the place of a state file that is lost or has come to harm: what it held when it was seen last, as far as such a
+// file says it. Of a list of everybody that was never seen, what the owner's database is known to publish.
+Dictionary CXDVaultraConduit::lastKnownState(const CXDChangeRecord& record) {
+    if (!record.user() || !record.group()) return {};
+    Dictionary known = engine().knownGroupState(kConduitVaultra, *record.user(), *record.group());
+    if (known.empty() && record.changeMadeByDataOwner() && record.group()->str() == layout::kAllGroup)
+        known = engine().knownGroupState(kConduitCX, *record.user(), *record.group());
+    Dictionary state;
+    for (const char* key : {kMemberUIDState, kSubgroupUIDState, kCXGroupNameProperty, kDistributionListState})
+        if (const Value& part = known[key]) state.set(key, part);
+    return state;
+}
+
+bool CXDVaultraConduit::changeGroupName(CXDChangeRecord& record, int& code) {
+    const auto base = baseLocationOf(record);
+    if (!base || !record.group()) return false;
+    return _world.manager.write(stringForDictionary(layout::infoAfterRename(record.payload())),
+                                layout::groupInfoLocation(*base, *record.group()), false, &code);
+}
+
+bool CXDVaultraConduit::addRecordToGroup(CXDChangeRecord& record, int& code) {
+    const auto base = baseLocationOf(record);
+    if (!base || !record.group() || !record.person()) return false;
+    return _world.manager.write(std::string(layout::kMemberMarkerText),
+                                layout::memberMarkerLocation(*base, *record.group(), *record.person()), false, &code);
+}
+
+bool CXDVaultraConduit::deleteRecord(CXDChangeRecord& record, int& code) {
+    const auto base = baseLocationOf(record);
+    if (!base || !record.person()) return false;
+    return _world.manager.removeFileAtURL(layout::contactLocation(*base, *record.person()), &code);
+}
+
+bool CXDVaultraConduit::deleteGroup(CXDChangeRecord& record, int& code) {
+    const auto base = baseLocationOf(record);
+    if (!base || !record.group()) return false;
+    return _world.manager.removeFileAtURL(layout::groupLocation(*base, *record.group()), &code);
+}
+
+} // namespace rolvane

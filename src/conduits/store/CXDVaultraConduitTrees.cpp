@@ -1,0 +1,175 @@
+// The half of the network store's conduit that judges trees: whether a state is to be believed, and what mends the
+// owner's.
+
+#include "conduits/store/CXDVaultraConduit.h"
+
+#include "conduits/store/EndedPublication.h"
+#include "conduits/store/StoreComparison.h"
+#include "conduits/store/TreeCondition.h"
+#include "contacts/database/CXRolvane.h"
+#include "contacts/records/Constants.h"
+#include "contacts/records/Identifier.h"
+#include "foundation/Log.h"
+#include "foundation/Preferences.h"
+#include "model/PayloadKeys.h"
+#include "model/RemoteLocationMap.h"
+
+#include <map>
+#include <set>
+#include <utility>
+
+namespace rolvane {
+namespace {
+
+// In the prior state of the owner's tree: something was amiss there that may be so for a moment only.
+constexpr const char* kLookAgain = "LookAgain";
+
+} // namespace
+
+bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state) {
+    const bool isOwn = user == kSelf;
+    const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
+    const Dictionary* known = users[user.str()].dictionaryIf();
+    if (!known) return true;
+    Dictionary prior = *known;
+    if (isOwn && !isMended(prior, state)) return false;
+    const Value knownSerial = prior[kSerialNumber], serial = state[kSerialNumber];
+    if (!serial.isString() || (knownSerial.isString() && knownSerial != serial)) return true; // no tree, or another one
+    const TreeCondition condition = treeCondition(prior, state, isOwn ? _lastSyncDate : std::nullopt);
+    const Value looked = prior[kLookAgain];
+    prior.remove(kLookAgain);
+    if (condition.isSound()) {
+        prior.set(kTreeDates, state[kTreeDates].dictionary());
+        _read.emplace(user, state);
+        if (isOwn) mendOwnTree(prior, state);
+        return true;
+    }
+    CXLog("The tree of %@ %@. %@", isOwn ? *realUserFromUser(user) : user, condition.sentence,
+          isOwn ? "It is published again." : "It is left alone until its owner has mended it.");
+    if (condition.kind == TreeCondition::Kind::setBack) prior.set(kTreeDates, datesToWaitFor(state));
+    if (!isOwn) {
+        _setBack.insert(user);
+        return false;
+    }
+    const bool isRefused = !engine().conduitObjectForKey(kConduitCX, kRefusedByStore).empty();
+    if (condition.kind == TreeCondition::Kind::lostAGroup && isRefused) return false; // it could not be written yet
+    if (condition.mayPass() && !looked)
+        prior.set(kLookAgain, true);
+    else
+        publishAgain();
+    engine().bringSourcesUpToDate(); // after this pass
+    return false;
+}
+
+// Single files that are too many or too few: another writer has deleted what somebody else was about to write, or the
+// store has lost them.
+void CXDVaultraConduit::mendOwnTree(const Dictionary& prior, const Dictionary& state) {
+    if (_isWrittenByOthers) _leftovers = removalOfUnlisted(prior, state);
+    if (!allGroupHas(kCXRemoteLocationProperty)) return; // the list may be older than the withdrawal
+    if (_isWrittenByOthers) takeNamesAloneOut(prior, state);
+    size_t written = 0;
+    for (const UniqueId& name : contactsThatAreMissing(state)) {
+        const CXRecordRef person = _world.rolvane.recordForUniqueId(cxUIDWithTableName(name, kCXPersonTable));
+        if (!person) continue;
+        auto update = std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, CXDUpdateRecord, kSelf, person->uniqueId(),
+                                                        std::nullopt, person->dictionaryRepresentation());
+        update->setAppliesToSources(CXDSyncSourceVaultra);
+        _leftovers.push_back(std::move(update));
+        ++written;
+    }
+    if (written > 0) CXLog("The store has lost the files of %@ contacts, which are written again.", written);
+}
+
+// Groups that name a contact or a group which is nowhere, or a group that the owner's database cannot take in.
+void CXDVaultraConduit::takeNamesAloneOut(Dictionary prior, const Dictionary& state) {
+    const Dictionary alone = namesAlone(
+        prior, state, [&](const UniqueId& name) { return _world.rolvane.recordForUniqueId(name) != nullptr; });
+    const Dictionary circles = closingCircles(state, [&](const UniqueId& name) {
+        std::vector<UniqueId> inner;
+        if (const auto group = std::dynamic_pointer_cast<CXGroup>(_world.rolvane.recordForUniqueId(name)))
+            inner = group->subgroupUniqueIds();
+        for (UniqueId& each : inner) each = cxUIDWithTableName(each, kCXGroupTable);
+        return inner;
+    });
+    const CXDChangeRecords removals = removalOfNamesAlone(prior, alone, circles);
+    _leftovers.insert(_leftovers.end(), removals.begin(), removals.end());
+    if (const Dictionary all = namesTogether(alone, circles); all.empty())
+        prior.remove(kNamesAlone);
+    else
+        prior.set(kNamesAlone, all);
+}
+
+// True when nothing had to be mended, or has been long since. When the last of it is on the store: where nobody but the
+// owner may write, what is there beside it comes from an older copy, and goes.
+bool CXDVaultraConduit::isMended(const Dictionary& prior, const Dictionary& state) {
+    const Dictionary again = engine().conduitObjectForKey(kConduitCX, kPublishAgain);
+    if (again.empty()) return true;
+    if (isToBePublishedAgain()) return false;
+    engine().setConduitObjectForKey(kConduitCX, Dictionary(), kPublishAgain);
+    if (somebodyMayWrite()) return true;
+    _leftovers = removalOfLeftovers(prior, state);
+    return _leftovers.empty();
+}
+
+bool CXDVaultraConduit::somebodyMayWrite() {
+    return allGroupHas(kCXReadWriteSharingACLProperty);
+}
+
+// Empty lists stay where somebody was or something stood once.
+bool CXDVaultraConduit::allGroupHas(const char* property) {
+    const auto entries = _world.rolvane.allGroup()->multiValueForProperty(property);
+    return entries && !entries->empty();
+}
+
+CXDChangeRecords CXDVaultraConduit::changeRecords() {
+    CXDChangeRecords records = CXDConduit::changeRecords();
+    if (_world.rolvane.allGroup()->valueForProperty(kCXRemoteLocationProperty) && endedPublication(_world.preferences))
+        _world.preferences.remove(kDaemonDomain, kCXDEndedPublication); // published again since
+    _publishesAgain = !engine().conduitObjectForKey(kConduitCX, kPublishAgain).empty();
+    leaveUnlistedOut(records);
+    _read.clear();
+    records.insert(records.end(), _leftovers.begin(), _leftovers.end());
+    _leftovers.clear();
+    return records;
+}
+
+// A contact that the list of everybody does not name and that joins no group is about to be added, and comes when it is
+// listed; or it has been deleted and was written once more by somebody who did not know. Whoever knows it reads what is
+// written. Nobody else takes it in: it would stay behind when its file goes. From the own tree it is taken away.
+// (Where single groups are published, the list of everybody does not name all who have joined one since.)
+void CXDVaultraConduit::leaveUnlistedOut(CXDChangeRecords& records) {
+    std::map<UserName, ListedNames> lists;
+    std::set<std::pair<UserName, UniqueId>> joining;
+    for (const CXDChangeRecordPtr& record : records)
+        if (record->type() == CXDAddRecordToGroup && record->person() && record->user() &&
+            _read.contains(*record->user()))
+            joining.emplace(*record->user(), *record->person());
+    std::erase_if(records, [&](const CXDChangeRecordPtr& record) {
+        if (record->type() != CXDUpdateRecord || !record->person() || !record->user()) return false;
+        const auto read = _read.find(*record->user());
+        if (read == _read.end()) return false;
+        if (joining.contains({*record->user(), *record->person()})) return false;
+        const UniqueId shared = cxNormalizedUID(*record->person());
+        if (lists.try_emplace(*record->user(), read->second, kMemberUIDState).first->second.contains(shared))
+            return false;
+        if (_world.rolvane.recordForUniqueId(*record->person())) return false;
+        CXDLog("Not listed, and left out: %@", record);
+        if (record->user() == kSelf && _isWrittenByOthers) _leftovers.push_back(removalOfContact(shared));
+        return true;
+    });
+}
+
+// The next scan takes everything for new.
+void CXDVaultraConduit::publishAgain() {
+    engine().conduitObjectForKey(kConduitCX, kPublishAgain).set(kSelf.str(), false);
+    restoreAccessLists();
+}
+
+// Until all of it is written, what the owner's tree says is not news, and nobody is told that the owner has been there.
+bool CXDVaultraConduit::isToBePublishedAgain() {
+    const Dictionary again = engine().conduitObjectForKey(kConduitCX, kPublishAgain);
+    if (again.empty()) return false;
+    return !again[kSelf.str()].boolean() || engine().hasPendingChanges(kSelf, conduitSource());
+}
+
+} // namespace rolvane

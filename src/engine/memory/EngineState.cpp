@@ -1,0 +1,252 @@
+#include "engine/memory/EngineState.h"
+
+#include "engine/queue/RefusedChanges.h"
+#include "foundation/CXException.h"
+#include "foundation/KeyedArchive.h"
+#include "foundation/Log.h"
+#include "model/PayloadKeys.h"
+#include "model/RemoteLocationMap.h"
+
+#include <algorithm>
+#include <map>
+#include <tuple>
+#include <utility>
+
+namespace rolvane {
+
+namespace {
+constexpr const char* kSubscriptionMap = "subscriptionMap";
+constexpr const char* kRecordClass = "CXDChangeRecord";
+} // namespace
+
+Dictionary EngineState::loadedConduitData() {
+    if (!_conduitData) {
+        const Value stored = _preferences.get(kDaemonDomain, kCXDConduitData);
+        _conduitData = stored.isDictionary() ? stored.deepMutableCopy().dictionary() : Dictionary();
+    }
+    return *_conduitData;
+}
+
+Dictionary EngineState::conduitData() {
+    const std::lock_guard guard(_lock);
+    return loadedConduitData();
+}
+
+void EngineState::dropConduitData() {
+    const std::lock_guard guard(_lock);
+    _conduitData.reset();
+}
+
+void EngineState::withConduitData(const std::function<void(Dictionary&)>& use) {
+    const std::lock_guard guard(_lock);
+    Dictionary data = loadedConduitData();
+    use(data);
+}
+
+Dictionary EngineState::conduitObjectForKey(const std::string& conduitID, const std::string& key) {
+    const std::lock_guard guard(_lock);
+    return loadedConduitData().dictionaryFor(conduitID).dictionaryFor(key);
+}
+
+void EngineState::setConduitObjectForKey(const std::string& conduitID, const Value& object, const std::string& key) {
+    const std::lock_guard guard(_lock);
+    loadedConduitData().dictionaryFor(conduitID).set(key, object);
+}
+
+void EngineState::putConduitData() {
+    _preferences.set(kDaemonDomain, kCXDConduitData, conduitData());
+    _preferences.remove(kDaemonDomain, kCXDConduitDataIntent);
+    _preferences.remove(kDaemonDomain, kCXDArrivalsIntent);
+}
+
+void EngineState::intendConduitData(const Dictionary& mark) {
+    _preferences.set(kDaemonDomain, kCXDConduitDataIntent, Dictionary{{"data", conduitData()}, {"mark", mark}});
+    _preferences.synchronize(kDaemonDomain);
+}
+
+void EngineState::dropIntent() {
+    _preferences.remove(kDaemonDomain, kCXDConduitDataIntent);
+    _preferences.synchronize(kDaemonDomain);
+}
+
+void EngineState::intendArrivals(const Dictionary& mark, const Array& arrivals) {
+    _preferences.set(kDaemonDomain, kCXDArrivalsIntent,
+                     Dictionary{{"data", conduitData()}, {"mark", mark}, {"arrivals", arrivals}});
+    _preferences.synchronize(kDaemonDomain);
+}
+
+void EngineState::recoverConduitData(const std::function<bool(const Dictionary& mark)>& hasSavedSince,
+                                     const std::function<void(Dictionary& data, const Array& arrivals)>& fold) {
+    const Dictionary whole = _preferences.get(kDaemonDomain, kCXDConduitDataIntent).dictionary();
+    const Dictionary part = _preferences.get(kDaemonDomain, kCXDArrivalsIntent).dictionary();
+    if (whole.empty() && part.empty()) return;
+    const auto counts = [&](const Dictionary& intent) {
+        return intent["data"].isDictionary() && hasSavedSince(intent["mark"].dictionary());
+    };
+    if (counts(whole)) {
+        _preferences.set(kDaemonDomain, kCXDConduitData, whole["data"]);
+    } else if (counts(part)) {
+        Dictionary data = part["data"].deepMutableCopy().dictionary();
+        fold(data, part["arrivals"].array());
+        _preferences.set(kDaemonDomain, kCXDConduitData, data);
+    }
+    dropConduitData();
+    _preferences.remove(kDaemonDomain, kCXDArrivalsIntent);
+    dropIntent();
+}
+
+void EngineState::syncPrefs() {
+    putConduitData();
+    _preferences.synchronize(kDaemonDomain);
+}
+
+CXDChangeRecords EngineState::getPendingChanges() const {
+    CXDChangeRecords records;
+    try {
+        const Value stored = _preferences.get(kDaemonDomain, kCXDPendingChanges);
+        if (!stored.isData()) return records;
+        KeyedArchive::unarchive(stored.data(), [&](KeyedArchive::Object object) {
+            if (object.className == kRecordClass)
+                records.push_back(std::make_shared<CXDChangeRecord>(DictionaryCoder(std::move(object.keys))));
+        });
+    } catch (const CXException& e) {
+        // What does not unarchive is no queue. A file that cannot be read just now is something else: its queue stays.
+        if (e.name() == kCXPreferencesException) throw;
+        records.clear();
+    }
+    return records;
+}
+
+void EngineState::setPendingChanges(const CXDChangeRecords& records) {
+    const auto archived = [&](size_t i) {
+        DictionaryCoder coder;
+        records[i]->encodeWithCoder(coder);
+        return KeyedArchive::Object{kRecordClass, coder.entries()};
+    };
+    _preferences.setData(kDaemonDomain, kCXDPendingChanges, KeyedArchive::archive(records.size(), archived));
+    _preferences.synchronize(kDaemonDomain);
+}
+
+Dictionary EngineState::underWay() const {
+    return _preferences.get(kDaemonDomain, kCXDUnderWay).dictionary();
+}
+
+void EngineState::setUnderWay(const Dictionary& underWay) {
+    _preferences.set(kDaemonDomain, kCXDUnderWay, underWay.empty() ? Value() : Value(underWay));
+}
+
+void EngineState::noteRefusedChanges(const std::vector<Refusal>& refusals, Date when) {
+    constexpr size_t kKept = 20;
+    std::map<std::tuple<std::string, std::string, std::string>, int64_t> alike;
+    for (const Refusal& refusal : refusals) ++alike[{refusal.user.str(), refusal.why, refusal.group}];
+    Array notes = _preferences.get(kDaemonDomain, kCXDRefusedChanges).array().mutableCopy();
+    for (const auto& [of, changes] : alike) {
+        const auto& [user, why, group] = of;
+        Dictionary note{{kRefusedDate, when}, {kRefusedUser, user}, {kRefusedChanges, changes}};
+        if (!why.empty()) note.set(kRefusedWhy, why);
+        if (!group.empty()) note.set(kRefusedGroup, group);
+        notes.append(note);
+    }
+    while (notes.count() > kKept) notes.removeAt(0);
+    _preferences.set(kDaemonDomain, kCXDRefusedChanges, notes);
+}
+
+void EngineState::noteRefusedByOwnStore(size_t changes, std::optional<Date> when) {
+    const Array before = _preferences.get(kDaemonDomain, kCXDRefusedChanges).array();
+    Array notes;
+    Value since = when ? Value(*when) : Value();
+    for (const Value& note : before) {
+        const Dictionary of = note.dictionary();
+        if (of[kRefusedWhy] != Value(kRefusedByOwnStore))
+            notes.append(note);
+        else if (!when)
+            since = of[kRefusedDate];
+    }
+    if (changes > 0 && since)
+        notes.append(Dictionary{{kRefusedDate, since},
+                                {kRefusedUser, kSelf},
+                                {kRefusedChanges, static_cast<int64_t>(changes)},
+                                {kRefusedWhy, kRefusedByOwnStore}});
+    if (notes != before) _preferences.set(kDaemonDomain, kCXDRefusedChanges, notes);
+}
+
+void EngineState::noteRefused(const Refusal& refusal) {
+    const std::lock_guard guard(_lock);
+    _refused.push_back(refusal);
+}
+
+std::vector<Refusal> EngineState::takeRefused() {
+    const std::lock_guard guard(_lock);
+    return std::exchange(_refused, {});
+}
+
+void EngineState::setRemoteLocationForSubscriptionUID(const std::optional<RemoteLocation>& location,
+                                                      const std::optional<UniqueId>& subscription) {
+    if (!location || !subscription) return;
+    const std::lock_guard guard(_lock);
+    loadedConduitData().dictionaryFor(kSubscriptionMap).set(subscription->str(), *location);
+}
+
+std::optional<RemoteLocation> EngineState::remoteLocationForSubscriptionUID(const UniqueId& subscription) {
+    const std::lock_guard guard(_lock);
+    const Value map = loadedConduitData()[kSubscriptionMap];
+    const Dictionary* locations = map.dictionaryIf();
+    const std::string* location = locations ? (*locations)[subscription.str()].stringIf() : nullptr;
+    return location ? std::optional(RemoteLocation(*location)) : std::nullopt;
+}
+
+void EngineState::removeSubscriptionMapForRemoteLocation(const RemoteLocation& location) {
+    const std::lock_guard guard(_lock);
+    const Value map = loadedConduitData()[kSubscriptionMap];
+    if (!map.isDictionary()) return;
+    Dictionary locations = map.dictionary();
+    for (const std::string& subscription : locations.allKeys())
+        if (locations[subscription] == Value(location)) locations.remove(subscription);
+}
+
+void EngineState::removeSubscription(const UniqueId& subscription) {
+    const std::lock_guard guard(_lock);
+    const Value map = loadedConduitData()[kSubscriptionMap];
+    if (map.isDictionary()) map.dictionary().remove(subscription.str());
+}
+
+bool EngineState::isOfFormerSubscription(const RemoteLocation& location, const UniqueId& subscription) {
+    const std::lock_guard guard(_lock);
+    const Value map = loadedConduitData()[kSubscriptionMap];
+    const Dictionary* locations = map.dictionaryIf();
+    if (!locations || locations->contains(subscription.str())) return false;
+    return std::any_of(locations->begin(), locations->end(),
+                       [&](const auto& entry) { return entry.second == Value(location); });
+}
+
+void EngineState::forgetUser(const UserName& user) {
+    if (user == kSelf) {
+        withConduitData([](Dictionary& data) { forgetRefusedChanges(data); });
+        noteRefusedByOwnStore(0, std::nullopt);
+    }
+    for (const char* conduit : {kConduitVaultra, kConduitCX})
+        conduitObjectForKey(conduit, kPriorState).remove(user.str());
+    CXDChangeRecords pending = getPendingChanges();
+    if (std::erase_if(pending, [&](const CXDChangeRecordPtr& r) { return r->user() == user; }) > 0)
+        setPendingChanges(pending);
+}
+
+void EngineState::claim(int64_t shareCount, const std::optional<UserName>& user) {
+    if (!_preferences.get(kDaemonDomain, kCXDShareCount)) _preferences.set(kDaemonDomain, kCXDShareCount, shareCount);
+    if (user && !_preferences.get(kDaemonDomain, kCXDLastOstrelUser))
+        _preferences.set(kDaemonDomain, kCXDLastOstrelUser, *user);
+}
+
+// Whose rights were taken away keeps to be sent: the access lists' changes belong to the account's tree, whatever
+// database it is filled from.
+void EngineState::reset() {
+    CXDLog("Reset!");
+    for (const char* key : {kCXDPendingChanges, kCXDConduitData, kCXDVaultraConduitLastSyncDate,
+                            kCXDCXConduitLastSyncDate, kCXDLocalConduitLastSyncDate, kCXDShareCount, kCXDLastOstrelUser,
+                            kCXDConduitDataIntent, kCXDArrivalsIntent, kCXDUnderWay})
+        _preferences.remove(kDaemonDomain, key);
+    _preferences.synchronize(kDaemonDomain);
+    dropConduitData();
+}
+
+} // namespace rolvane

@@ -1,0 +1,107 @@
+#pragma once
+
+#include "foundation/Preferences.h"
+#include "foundation/StrongString.h"
+#include "foundation/Value.h"
+#include "model/CXDChangeRecord.h"
+#include "model/Refusal.h"
+
+#include <functional>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace rolvane {
+
+// Keys of the daemon's domain.
+inline constexpr const char* kCXDPendingChanges = "CXDPendingChanges";
+inline constexpr const char* kCXDConduitData = "CXDConduitData";
+inline constexpr const char* kCXDConduitDataIntent = "CXDConduitDataIntent";
+inline constexpr const char* kCXDArrivalsIntent = "CXDArrivalsIntent";
+inline constexpr const char* kCXDUnderWay = "CXDUnderWay"; // engine/recovery/UnderWay.h
+inline constexpr const char* kCXDVaultraConduitLastSyncDate = "CXDVaultraConduitLastSyncDate";
+inline constexpr const char* kCXDCXConduitLastSyncDate = "CXDCXConduitLastSyncDate";
+inline constexpr const char* kCXDLocalConduitLastSyncDate = "CXDLocalConduitLastSyncDate";
+inline constexpr const char* kCXDUnsavedAccessLists = "CXDUnsavedAccessLists"; // see CXDVaultraConduit
+inline constexpr const char* kCXDShareCount = "CXDShareCount";
+inline constexpr const char* kCXDLastOstrelUser = "CXDLastOstrelUser";
+// What stores have refused, the latest last, for people to see: an array of dictionaries with these keys.
+inline constexpr const char* kCXDRefusedChanges = "CXDRefusedChanges";
+inline constexpr const char* kRefusedDate = "date";
+inline constexpr const char* kRefusedUser = "user";       // whose contacts they were
+inline constexpr const char* kRefusedChanges = "changes"; // how many
+inline constexpr const char* kRefusedWhy = "why";         // as Refusal has them; missing when empty
+inline constexpr const char* kRefusedGroup = "group";
+
+// The engine's memory: the conduit data and the queue, in the daemon's preferences. The conduit data is read on first
+// need and lives in memory until it is dropped. Finding a conduit's dictionary is safe on any thread; the dictionaries
+// that are found are shared and have no lock. Everything else on the main thread.
+class EngineState {
+public:
+    explicit EngineState(Preferences& preferences) : _preferences(preferences) {}
+
+    Dictionary conduitData();
+    void dropConduitData(); // the next use reads it again
+    void withConduitData(const std::function<void(Dictionary&)>& use);
+    Dictionary conduitObjectForKey(const std::string& conduitID, const std::string& key); // made empty when absent
+    void setConduitObjectForKey(const std::string& conduitID, const Value& object, const std::string& key);
+    void putConduitData(); // without synchronising
+    // Puts down durably what the conduit data will be once the contact database has been saved: the next
+    // putConduitData takes its place. `mark` is the database's historyMark before that save.
+    void intendConduitData(const Dictionary& mark);
+    void dropIntent();
+    // The same before a save in the middle of a pass, which puts a part of the arrivals (engine/recovery/Arrivals.h) on
+    // the disk together with what the conduit data says already. Good for all later saves of the pass, until
+    // putConduitData.
+    void intendArrivals(const Dictionary& mark, const Array& arrivals);
+    // At the daemon's start, and when a pass could not save, before the conduit data is used: a pass that ended between
+    // such a save and putConduitData has its intent carried out; what is meant for a save that never came is dropped.
+    void recoverConduitData(const std::function<bool(const Dictionary& mark)>& hasSavedSince,
+                            const std::function<void(Dictionary& data, const Array& arrivals)>& fold);
+    void syncPrefs(); // putConduitData, then synchronise
+
+    // A queue that cannot be read is empty.
+    CXDChangeRecords getPendingChanges() const;
+    void setPendingChanges(const CXDChangeRecords& records);
+
+    // What a pass is about to put on the store: from before its first write, durably, to its very end.
+    Dictionary underWay() const;
+    void setUnderWay(const Dictionary& underWay); // without synchronising; empty: removes it
+
+    // Adds what a pass was refused; the oldest are forgotten. Without synchronising.
+    void noteRefusedChanges(const std::vector<Refusal>& refusals, Date when);
+    // The one note of the owner's own changes that the owner's store refuses, as long as it does: how many they are,
+    // and none when there are none. `when`: the date of a new refusal. Without synchronising.
+    void noteRefusedByOwnStore(size_t changes, std::optional<Date> when);
+    // What a pass meets on its way, for that note. Any thread; in memory only.
+    void noteRefused(const Refusal& refusal);
+    std::vector<Refusal> takeRefused();
+
+    // Subscription identifier to remote location. Nothing happens when one of the two is missing.
+    void setRemoteLocationForSubscriptionUID(const std::optional<RemoteLocation>& location,
+                                             const std::optional<UniqueId>& subscription);
+    std::optional<RemoteLocation> remoteLocationForSubscriptionUID(const UniqueId& subscription);
+    void removeSubscriptionMapForRemoteLocation(const RemoteLocation& location); // every subscription to it
+    void removeSubscription(const UniqueId& subscription);
+    // Is what is remembered of the location known by other subscriptions only?
+    bool isOfFormerSubscription(const RemoteLocation& location, const UniqueId& subscription);
+    // What both conduits remember of the user, and the user's changes in the queue (durably). Nothing else is written.
+    void forgetUser(const UserName& user);
+
+    // What is remembered counts only together with the database's share count and the account's user: where they are
+    // missing they are put down with it. Without synchronising.
+    void claim(int64_t shareCount, const std::optional<UserName>& user);
+    void reset(); // forgets everything, durably
+    Preferences& preferences() const { return _preferences; }
+
+private:
+    Dictionary loadedConduitData(); // with _lock held
+
+    Preferences& _preferences;
+    std::mutex _lock;
+    std::optional<Dictionary> _conduitData; // guarded by _lock, as is
+    std::vector<Refusal> _refused;
+};
+
+} // namespace rolvane

@@ -1,0 +1,559 @@
+#include "engine/pass/ApplyLoop.h"
+
+#include "contacts/database/CXRolvane.h"
+#include "contacts/records/Constants.h"
+#include "contacts/records/Identifier.h"
+#include "engine/memory/PublicationCache.h"
+#include "engine/pass/OutOfOrderWork.h"
+#include "engine/queue/ChangeQueue.h"
+#include "engine/queue/Mingler.h"
+#include "engine/queue/RecordIdentity.h"
+#include "engine/queue/RefusedChanges.h"
+#include "engine/recovery/Arrivals.h"
+#include "engine/recovery/GoneThings.h"
+#include "engine/recovery/Holdings.h"
+#include "engine/recovery/UnderWay.h"
+#include "engine/recovery/UnsettledGroups.h"
+#include "foundation/CXException.h"
+#include "foundation/Log.h"
+#include "model/PayloadKeys.h"
+#include "model/RemoteLocationMap.h"
+#include "store/files/CXFileManager.h"
+
+#include <algorithm>
+#include <iterator>
+#include <utility>
+
+namespace rolvane {
+
+namespace {
+
+void append(CXDChangeRecords& to, CXDChangeRecords&& from) {
+    to.insert(to.end(), std::make_move_iterator(from.begin()), std::make_move_iterator(from.end()));
+}
+
+CXDChangeRecords mingled(const CXDChangeRecords& input) {
+    Mingler mingler;
+    mingler.mingle(input);
+    return mingler.takeMingled();
+}
+
+bool waitsForTheFolderAlone(const CXDChangeRecord& record) {
+    return record.appliesToSources() == CXDSyncSourceLocal;
+}
+
+// Without what waits for other trees, which have groups of the same names, and for sources that no pass writes to.
+Dictionary unsettledOwnGroups(const CXDChangeRecords& records, size_t fresh) {
+    if (records.size() <= fresh) return {};
+    const auto queue = records.begin() + static_cast<std::ptrdiff_t>(fresh);
+    CXDChangeRecords own = ownWrites({records.begin(), queue});
+    const size_t freshOwn = own.size();
+    append(own, ownWrites({queue, records.end()}));
+    return unsettledGroups(own, freshOwn);
+}
+
+// Tells the file managers what the apply loop is going to read, and that it has ended.
+class ReadingAhead {
+public:
+    explicit ReadingAhead(const CXDChangeRecords& records) {
+        std::vector<Url> urls;
+        for (const CXDChangeRecordPtr& record : records) {
+            if (!(record->appliesToSources() & CXDSyncSourceCX) || !record->delayedPayloadURL()) continue;
+            if (!_manager) _manager = record->fileManager();
+            if (record->fileManager() != _manager) continue;
+            urls.push_back(*record->delayedPayloadURL());
+            _positions.push_back(static_cast<size_t>(&record - records.data()));
+        }
+        if (_manager) _manager->expectReads(urls, true); // payloads are read securely
+    }
+    ~ReadingAhead() {
+        if (_manager) _manager->expectReads({}, true);
+    }
+    // The position of the record that has `count` such ones behind it; past the end where there are not so many.
+    size_t lastBut(size_t count) const {
+        return _positions.size() > count ? _positions[_positions.size() - 1 - count] : SIZE_MAX;
+    }
+    ReadingAhead(const ReadingAhead&) = delete;
+    ReadingAhead& operator=(const ReadingAhead&) = delete;
+
+private:
+    CXFileManager* _manager = nullptr; // of the network store, the one that a pass reads
+    std::vector<size_t> _positions;    // of the records that read something
+};
+
+class NotingArrivals {
+public:
+    NotingArrivals(EngineParts& parts, std::function<void()> note) : _parts(parts) {
+        _parts.beforeSaveInThePass = std::move(note);
+    }
+    ~NotingArrivals() { _parts.beforeSaveInThePass = {}; }
+    NotingArrivals(const NotingArrivals&) = delete;
+    NotingArrivals& operator=(const NotingArrivals&) = delete;
+
+private:
+    EngineParts& _parts;
+};
+
+} // namespace
+
+bool isGivenUp(EngineParts& parts, const CXDChangeRecord& record) {
+    const bool isOfCopy = record.initialSource() == CXDSyncSourceCX && !record.changeMadeByDataOwner();
+    return !isOfCopy && parts.denied.contains(record);
+}
+
+void saveACLs(EngineParts& parts) {
+    parts.conduits.vaultra->saveACLs();
+    parts.conduits.cx->saveACLs();
+}
+
+ApplyLoop::ApplyLoop(EngineParts& parts, Actions actions) : _parts(parts), _actions(std::move(actions)) {}
+ApplyLoop::~ApplyLoop() = default;
+
+void ApplyLoop::run(CXDChangeRecords records, bool trickle, bool allowRetry) {
+    _unhandled = std::move(records);
+    updateStateAndExitIfNeeded(_parts);
+    _parts.with.progress.startedPhase(2);
+    _actions.persist();
+
+    std::exception_ptr foreign;
+    try {
+        applyAll(trickle);
+    } catch (const CXException& e) {
+        CXLog("applyChangeRecords: Caught %@: %@", e.name(), e.reason());
+        _parts.outcomes.caught(e.reason());
+    } catch (...) {
+        foreign = std::current_exception();
+    }
+    cleanUp();
+    if (foreign) std::rethrow_exception(foreign);
+
+    std::exception_ptr notStored;
+    try {
+        storeAndClose(allowRetry);
+    } catch (const CXException& e) {
+        CXLog("applyChangeRecords close: Caught %@: %@", e.name(), e.reason());
+        _parts.outcomes.couldNotStore(e.reason());
+        if (trickle && !_queueStored) notStored = std::current_exception();
+    }
+    _parts.denied.clear(); // also when nothing could be stored: what comes again is to be asked again
+    _parts.revoked.clear();
+    bumpShareCount();
+    _parts.with.progress.stop();
+    _actions.persist();
+    // Whoever handed the changes over still has them, and must not take them for done. A full pass finds its own again.
+    if (notStored) std::rethrow_exception(notStored);
+}
+
+void ApplyLoop::applyAll(bool trickle) {
+    if (trickle) {
+        CXDLog("TRICKLE");
+        _parts.conduits.cx->open();
+        _parts.conduits.vaultra->open();
+    }
+    const size_t fresh = _unhandled.size();
+    append(_unhandled, _parts.state.getPendingChanges());
+    _queueTaken = true;
+    setAside(fresh);
+    _underWay = _parts.state.underWay(); // of a pass that was killed, or what an earlier one left adrift
+    _unsettled = unsettledGroups(_unhandled, fresh);
+    for (const auto& [group, isSo] : unsettledOwnGroups(_unhandled, fresh)) noteUnsure(UniqueId(group));
+    withdrawWhatIsGone(_unhandled, fresh, _parts.with.rolvane);
+    dropRemovalsOfWhatIsBack(_unhandled, fresh, _parts.with.rolvane);
+    if (!_underWay->empty())
+        _parts.state.withConduitData(
+            [&](Dictionary& data) { settleUnderWay(*_underWay, _unhandled, data, _parts.with.rolvane); });
+    queue();
+    _parts.with.progress.startedPhase(3);
+    split();
+    applyOutOfOrder();
+    applyInOrder();
+}
+
+// What waits for the shared folder alone is applied by no pass, and says nothing about what the store holds: news of
+// the same contact would be taken for contradicted, or left for later, for as long as it waits.
+void ApplyLoop::setAside(size_t fresh) {
+    const auto queue = _unhandled.begin() + static_cast<std::ptrdiff_t>(fresh);
+    const auto first = std::stable_partition(
+        queue, _unhandled.end(), [](const CXDChangeRecordPtr& record) { return !waitsForTheFolderAlone(*record); });
+    _setAside.assign(first, _unhandled.end());
+    _unhandled.erase(first, _unhandled.end());
+    if (_setAside.empty()) return;
+    const std::unordered_set<CXDChangeRecordPtr, RecordHash, RecordEqual> again(_unhandled.begin(), _unhandled.end());
+    std::erase_if(_setAside, [&](const CXDChangeRecordPtr& record) { return again.contains(record); });
+    withdrawWhatIsGone(_setAside, 0, _parts.with.rolvane);
+    dropRemovalsOfWhatIsBack(_setAside, 0, _parts.with.rolvane);
+    _setAside = flattenGroupChanges(mingled(_setAside));
+    for (const CXDChangeRecordPtr& record : _setAside) record->packPayload();
+}
+
+// What the contact database swallows changes nothing, so it contradicts nothing: the owner's own change would be given
+// up for it, in this pass and in every following one.
+CXDChangeRecords ApplyLoop::accepted() {
+    CXDChangeRecords swallowed, others;
+    for (const CXDChangeRecordPtr& record : _unhandled)
+        (_parts.conduits.cx->swallows(*record) ? swallowed : others).push_back(record);
+    _takenOut = TakenOut(others);
+    for (const GroupThatIsGone& gone : _takenOut.drop(others)) {
+        const Dictionary known = _parts.state.conduitData()[kConduitVaultra].dictionary()[kPriorState].dictionary();
+        const Value& name = known[gone.user.str()].dictionary()[gone.group.str()].dictionary()[kCXGroupNameProperty];
+        _parts.state.noteRefused({gone.user, kRefusedAsGroupIsGone, name.string()});
+    }
+    CXDChangeRecords all = mingled(others);
+    append(all, mingled(swallowed));
+    return all;
+}
+
+void ApplyLoop::queue() {
+    CXDChangeRecords accepted = this->accepted();
+    CXDLog("Mingled: %@", accepted);
+    putNewsOfGroupsLast(accepted);
+    std::unordered_set<UniqueId> lossy;
+    CXDChangeRecords flat = flattenGroupChanges(accepted, &lossy);
+    for (const UniqueId& group : lossy) {
+        _unsettled.set(group.str(), true);
+        noteUnsure(group);
+    }
+    sortByType(flat);
+    _totalCount = flat.size();
+    _processedCount = 0;
+    CXDLog("Flat: %@", flat);
+    _unhandled = std::move(flat);
+}
+
+void ApplyLoop::split() {
+    for (const CXDChangeRecordPtr& record : _unhandled) _parts.with.progress.willProcessChangeRecord(record);
+    CXDChangeRecords outOfOrder;
+    for (CXDChangeRecordPtr& record : _unhandled)
+        (record->canApplyOutOfOrder() ? outOfOrder : _inOrder).push_back(std::move(record));
+    _unhandled.clear();
+    const Dictionary now = underWay(outOfOrder);
+    _underWay = underWayTogether(*_underWay, now);
+    _end.removed = removedBy(outOfOrder);
+    _outOfOrder = std::make_unique<OutOfOrderWork>(_parts, std::move(outOfOrder));
+    if (!now.empty()) noteUnderWay();
+}
+
+// What cannot be noted is not done: a later pass would find it on the store, take it for somebody else's, and bring it
+// back over what the owner has changed meanwhile.
+void ApplyLoop::noteUnderWay() {
+    claimState();
+    _parts.state.setUnderWay(*_underWay);
+    _parts.with.preferences.synchronize(kDaemonDomain);
+}
+
+void ApplyLoop::applyOutOfOrder() {
+    _outOfOrder->start(configuredWorkers(_parts.with.account));
+    _outOfOrder->wait();
+    _processedCount += _outOfOrder->processedCount();
+    noteRefused(); // before anything of this pass is saved
+    takeInMerged();
+}
+
+void ApplyLoop::noteRefused() {
+    if (_parts.denied.empty()) return;
+    _parts.state.withConduitData([&](Dictionary& data) {
+        noteRefusedChanges(data, _parts.denied.all(), _parts.denied.refused(), _parts.with.clock.now());
+    });
+}
+
+// What was merged on its way to the store is taken into the database as if it had come from there.
+void ApplyLoop::takeInMerged() {
+    CXDConduit& cx = *_parts.conduits.cx;
+    for (const CXDChangeRecordPtr& update : _parts.conduits.vaultra->takeMerged())
+        if (cx.swallows(*update) || !cx.applyChangeRecordIfNeeded(update, nullptr))
+            _parts.conduits.vaultra->wasRefused(*update); // to be read again
+}
+
+void ApplyLoop::applyInOrder() {
+    constexpr size_t kFew = 50;
+    const ReadingAhead ahead(_inOrder);
+    const NotingArrivals noting(_parts, [this] { noteArrivals(); });
+    for (; _inOrderDone < _inOrder.size(); ++_inOrderDone) {
+        const CXDChangeRecordPtr record = _inOrder[_inOrderDone]; // there may be more on the way
+        if (_inOrderDone == ahead.lastBut(kFew) && !_parts.terminating) _parts.conduits.vaultra->willClose();
+        applyInOrder(record);
+        ++_processedCount;
+        _parts.with.progress.didProcessChangeRecord(record);
+    }
+    takeInMerged();
+}
+
+// A version of a contact that has come while our own one could not be written: taken in now, it would stand here while
+// ours, which is written with the next pass, stands on the store. It is left unread, and offered again until then.
+bool ApplyLoop::meetsOwnWaitingWrite(const CXDChangeRecord& record) {
+    if (record.type() != CXDUpdateRecord || record.initialSource() == CXDSyncSourceCX || !record.person()) return false;
+    if (!_waitingWrites) {
+        _waitingWrites.emplace();
+        for (const CXDChangeRecordPtr& waiting : _outOfOrder->pending())
+            if (waiting->type() == CXDUpdateRecord && waiting->initialSource() == CXDSyncSourceCX &&
+                waiting->person() && (waiting->appliesToSources() & CXDSyncSourceVaultra))
+                _waitingWrites->emplace(waiting->user().value_or(UserName()), cxNormalizedUID(*waiting->person()));
+        for (const std::string& person : _parts.state.conduitObjectForKey(kConduitCX, kUnsettledPeople).allKeys())
+            _waitingWrites->emplace(kSelf, UniqueId(person)); // refused, and to be sent again
+    }
+    return !_waitingWrites->empty() &&
+           _waitingWrites->contains({record.user().value_or(UserName()), cxNormalizedUID(*record.person())});
+}
+
+// A change of another user's publication that concerns what is deleted here. Where the deletion was refused, the change
+// is what brings it back. Elsewhere it is left, and offered again should there be anything of it.
+bool ApplyLoop::isOfWhatWasTakenOutHere(const CXDChangeRecord& record) {
+    if (record.initialSource() == CXDSyncSourceCX || !_takenOut.concerns(record)) return false;
+    if (!_refusedUsers) {
+        _refusedUsers.emplace();
+        for (const CXDChangeRecordPtr& refused : _parts.denied.all())
+            _refusedUsers->insert(refused->user().value_or(UserName()));
+    }
+    return !_refusedUsers->contains(record.user().value_or(UserName()));
+}
+
+// Once a pass: what is noted then is good for all saves that follow.
+void ApplyLoop::noteArrivals() {
+    if (std::exchange(_arrivalsNoted, true)) return;
+    claimState();
+    _parts.state.intendArrivals(_parts.with.rolvane.historyMark(), arrivalsAmong(_inOrder, _inOrderDone));
+}
+
+// A first pass has this done long before it ends. Killed behind its first save, it would be a first pass again, for
+// which nothing of what is there came from a store.
+void ApplyLoop::claimState() {
+    _parts.state.claim(_parts.with.rolvane.shareCount(), _parts.with.account.vaultraUser());
+}
+
+void ApplyLoop::applyInOrder(const CXDChangeRecordPtr& record) {
+    int32_t left = record->appliesToSources();
+    if (!_parts.terminating && meetsOwnWaitingWrite(*record)) {
+        CXDLog("%@ waits until our own version is written", record);
+        left = 0;
+    } else if (!_parts.terminating && isOfWhatWasTakenOutHere(*record)) {
+        CXDLog("%@ is out", record);
+        left = 0;
+    } else if (!_parts.terminating) {
+        if ((left & CXDSyncSourceCX) && applyTo(*_parts.conduits.cx, CXDSyncSourceCX, record)) left &= ~CXDSyncSourceCX;
+        if (left & CXDSyncSourceVaultra) {
+            if (applyTo(*_parts.conduits.vaultra, CXDSyncSourceVaultra, record)) left &= ~CXDSyncSourceVaultra;
+            if (_denied) cancelLike(record);
+        }
+    }
+    if (left) {
+        record->setAppliesToSources(left);
+        _pendingChanges.push_back(record);
+        record->packPayload();
+    } else {
+        record->setPayload({}); // nobody asks for it again; 50,000 contacts with photos would fill the memory
+    }
+}
+
+bool ApplyLoop::applyTo(CXDConduit& conduit, int32_t source, const CXDChangeRecordPtr& record) {
+    if (source == CXDSyncSourceVaultra) _parts.outcomes.tried(*record);
+    if (!conduit.applyChangeRecordIfNeeded(record, &_denied)) {
+        if (_denied && source == CXDSyncSourceVaultra) _parts.denied.noteRefused(record);
+        return false;
+    }
+    if (isGivenUp(_parts, *record)) return true;
+    const bool swallowed = conduit.swallows(*record);
+    const bool ofOwnGroup = swallowed && noteSwallowed(*record);
+    // Done with, but not remembered: the next comparison offers it again.
+    if (swallowed && !ofOwnGroup && isOfAStrangeGroup(*record)) return true;
+    if (!ofOwnGroup && !conduit.holds(*record)) {
+        if (conduit.waitsForWhatFollows(*record)) tryAgainAtTheEnd(source, record);
+        return true;
+    }
+    _parts.state.withConduitData([&](Dictionary& data) {
+        didApplyChange(data, *record, source);
+        forgetRefusedChange(data, *record);
+    });
+    _parts.outcomes.applied(*record, source);
+    return true;
+}
+
+// Additions come before removals, and one may wait for the other. What still cannot be done then contradicts what else
+// is there; the next comparison offers it again.
+void ApplyLoop::tryAgainAtTheEnd(int32_t source, const CXDChangeRecordPtr& record) {
+    if (_secondTries.contains(record)) {
+        CXLog("%@ contradicts what is there already, and is left out until it does not", record);
+        return;
+    }
+    const CXDChangeRecordPtr again = record->copy();
+    again->setAppliesToSources(source);
+    _secondTries.insert(again);
+    _inOrder.push_back(again);
+    _parts.with.progress.willProcessChangeRecord(again);
+    ++_totalCount;
+}
+
+// What is remembered of an own group then is what the store holds, a name without a contact included, and not what the
+// database does. The next scan compares the two and gives the store the owner's. False of anything else: nobody knows
+// whether the database ever had what it does not have, so that stays on the store.
+bool ApplyLoop::noteSwallowed(const CXDChangeRecord& record) {
+    switch (record.type()) {
+    case CXDAddRecordToGroup:
+    case CXDAddGroupToGroup:
+    case CXDRemoveRecordFromGroup:
+    case CXDRemoveGroupFromGroup:
+    case CXDChangeGroupName:
+    case CXDUpdateDistributionList: break;
+    default: return false;
+    }
+    if (!record.group() || record.group()->str() == kCXAllGroupUID) return false;
+    if (!_parts.with.rolvane.recordForUniqueId(cxUIDWithTableName(*record.group(), kCXGroupTable))) return false;
+    _unsettled.set(record.group()->str(), true);
+    noteUnsure(*record.group());
+    return true;
+}
+
+// One that the database does not have. It comes when somebody may write, unless it is taken for known before.
+bool ApplyLoop::isOfAStrangeGroup(const CXDChangeRecord& record) const {
+    return record.group() && record.group()->str() != kCXAllGroupUID && record.type() != CXDDeleteGroup &&
+           !_parts.with.rolvane.recordForUniqueId(cxUIDWithTableName(*record.group(), kCXGroupTable));
+}
+
+// The list stays the same for the whole pass, so one walk a user is enough.
+void ApplyLoop::cancelLike(const CXDChangeRecordPtr& record) {
+    const bool walk = record->user() && _cancelledUsers.insert(*record->user()).second;
+    _parts.denied.cancelLike(record, walk ? _inOrder : CXDChangeRecords());
+}
+
+void ApplyLoop::cleanUp() {
+    try {
+        saveACLs(_parts);
+    } catch (const CXException& e) {
+        CXLog("applyChangeRecords: Caught %@: %@", e.name(), e.reason());
+    }
+    carryOver();
+    _parts.locks.unlockAllURLs();
+}
+
+// After a pass that ran to its end this gathers what the workers left; after an exception also what nobody came to.
+void ApplyLoop::carryOver() {
+    if (_outOfOrder) {
+        _outOfOrder->finish();
+        CXDChangeRecords pending = _outOfOrder->takePending();
+        append(pending, std::move(_pendingChanges));
+        append(pending, _outOfOrder->takeUntouched());
+        _pendingChanges = std::move(pending);
+        _outOfOrder.reset();
+    }
+    for (; _inOrderDone < _inOrder.size(); ++_inOrderDone) {
+        const CXDChangeRecordPtr& record = _inOrder[_inOrderDone];
+        if (_pendingChanges.empty() || _pendingChanges.back() != record) _pendingChanges.push_back(record);
+    }
+    _inOrder.clear();
+    append(_pendingChanges, std::move(_unhandled));
+    _unhandled.clear();
+    append(_pendingChanges, std::exchange(_setAside, {}));
+}
+
+void ApplyLoop::storeAndClose(bool allowRetry) {
+    if (!_queueTaken) append(_pendingChanges, _parts.state.getPendingChanges());
+    for (const CXDChangeRecordPtr& record : _parts.denied.all())
+        if (!isOwnWrite(*record)) _parts.outcomes.refused(record->user().value_or(UserName()));
+    std::erase_if(_pendingChanges, [&](const CXDChangeRecordPtr& record) { return _parts.denied.contains(*record); });
+    CXDLog("Pending: %@", _pendingChanges);
+    CXDLog("Denied:  %@", _parts.denied.all());
+    _parts.outcomes.leaves(_pendingChanges);
+    // A change leaves the queue only when the database that took it has it on the disk. And what the database took is
+    // known to have come from the store in the same moment: a copy that arrived in a pass which came to no end would be
+    // taken for the user's own addition.
+    CXRolvane& rolvane = _parts.with.rolvane;
+    claimState();
+    noteRefused();
+    if (_inOrderDone > 0) _parts.state.intendConduitData(rolvane.historyMark());
+    try {
+        rolvane.save();
+    } catch (...) {
+        _parts.state.dropIntent(); // another save is to mean nothing of it
+        throw;
+    }
+    for (const CXDChangeRecordPtr& record : _parts.denied.all()) takeBack(*record);
+    _parts.state.putConduitData();
+    _parts.state.setPendingChanges(_pendingChanges);
+    _queueStored = true;
+    _end.unsureGroups.merge(groupsOf(ownWrites(_pendingChanges)));
+    _end.everythingIsPublished = isPublished(*rolvane.allGroup());
+    const bool nothingWaits =
+        std::all_of(_pendingChanges.begin(), _pendingChanges.end(),
+                    [](const CXDChangeRecordPtr& record) { return waitsForTheFolderAlone(*record); });
+    const bool lookAgain = noteUnsettled() && nothingWaits;
+    _pendingChanges.clear();
+    tellRefused();
+    if (!_parts.denied.empty() || lookAgain) {
+        _parts.denied.clear();
+        if (allowRetry) _actions.scheduleRetry();
+    }
+    _parts.conduits.cx->close();
+    _parts.conduits.vaultra->close();
+}
+
+void ApplyLoop::tellRefused() {
+    const Date now = _parts.with.clock.now();
+    std::vector<Refusal> refused = _parts.state.takeRefused();
+    bool ofOwn = false;
+    for (const CXDChangeRecordPtr& record : _parts.denied.all())
+        if (isOwnWrite(*record))
+            ofOwn = true;
+        else
+            refused.push_back({record->user().value_or(UserName())});
+    if (!refused.empty()) _parts.state.noteRefusedChanges(refused, now);
+    size_t waiting = 0;
+    _parts.state.withConduitData([&](Dictionary& data) {
+        if (!ofOwn) settleRefusedChanges(data, now);
+        if (hasRefusedChanges(data)) waiting = countRefusedChanges(data);
+    });
+    _parts.outcomes.rests(kSelf, static_cast<int64_t>(waiting));
+    _parts.state.noteRefusedByOwnStore(waiting, ofOwn ? std::optional(now) : std::nullopt);
+}
+
+// What another user's store has refused is undone in the copy: contacts are read again, and a group counts as changed
+// there, so that the next comparison finds the store without the change.
+void ApplyLoop::takeBack(const CXDChangeRecord& record) {
+    if (record.initialSource() != CXDSyncSourceCX || record.changeMadeByDataOwner() || !record.user()) return;
+    _parts.conduits.vaultra->wasRefused(record);
+    if (!record.group()) return;
+    _parts.state.withConduitData([&](Dictionary& data) {
+        const Dictionary groups =
+            data[kConduitVaultra].dictionary()[kPriorState].dictionary()[record.user()->str()].dictionary();
+        if (groups.contains(cxUIDWithTableName(*record.group(), kCXGroupTable).str()))
+            updateCache(data, CXDSyncSourceVaultra, record);
+    });
+}
+
+void ApplyLoop::noteUnsure(const UniqueId& group) {
+    _end.unsureGroups.insert(cxUIDWithTableName(group, kCXGroupTable));
+}
+
+// The next scan takes them from there. False when there are none.
+bool ApplyLoop::noteUnsettled() {
+    if (_unsettled.empty()) return false;
+    _parts.state.conduitObjectForKey(kConduitCX, kUnsettledGroups).addEntriesFrom(_unsettled);
+    return true;
+}
+
+// Account and conduit data are put down first, so that they reach the disk in one piece with the share count. They
+// never run ahead of the database: what they say it holds and it does not would be taken for the user's own removal.
+void ApplyLoop::bumpShareCount() {
+    const std::optional<UserName> user = _parts.with.account.vaultraUser();
+    Preferences& preferences = _parts.with.preferences;
+    try {
+        _parts.with.rolvane.save();
+    } catch (const CXException& e) {
+        CXLog("applyChangeRecords: Caught %@: %@", e.name(), e.reason());
+        _parts.outcomes.couldNotStore(e.reason());
+        _parts.state.dropConduitData();
+        recoverConduitData(_parts); // what was saved in the middle of the pass is there
+        return;
+    }
+    try {
+        preferences.set(kDaemonDomain, kCXDLastOstrelUser, user ? Value(*user) : Value());
+        _parts.state.putConduitData();
+        if (_queueStored && _underWay) _parts.state.setUnderWay(adrift(*_underWay, _parts.state.conduitData(), _end));
+        _parts.outcomes.put();
+        _parts.with.rolvane.bumpShareCount(preferences);
+        preferences.synchronize(kDaemonDomain);
+    } catch (const CXException& e) {
+        CXLog("applyChangeRecords: Caught %@: %@", e.name(), e.reason());
+        _parts.outcomes.couldNotStore(e.reason());
+    }
+}
+
+} // namespace rolvane

@@ -1,0 +1,121 @@
+#include "engine/pass/OutcomeKeeper.h"
+
+#include "foundation/BootTime.h"
+#include "foundation/CXException.h"
+#include "foundation/Log.h"
+
+#include <utility>
+
+namespace rolvane {
+
+void OutcomeKeeper::begin(bool full, bool retry) {
+    const std::lock_guard guard(_lock);
+    _facts = {};
+    _facts.began = _clock.now();
+    _facts.beganSinceBoot = secondsSinceBoot();
+    _facts.full = full;
+    _facts.retry = retry;
+    _put.reset();
+    _running = true;
+    if (_sources.failures) (void)_sources.failures(); // of what was before
+    if (_previous) return;
+    try {
+        _previous = lastOutcome(_preferences);
+    } catch (const CXException& e) {
+        _facts.storage = e.reason();
+    }
+}
+
+void OutcomeKeeper::storeWasTested(bool reached, std::optional<PassFailure> why) {
+    const std::lock_guard guard(_lock);
+    _facts.storeReached = reached;
+    _facts.storeFailure = reached ? std::nullopt : std::move(why);
+}
+
+void OutcomeKeeper::treeWasLookedAt(const UserName& user, TreeLook how) {
+    const std::lock_guard guard(_lock);
+    _facts.looks[user] = how;
+}
+
+void OutcomeKeeper::tried(const CXDChangeRecord& record) {
+    const std::lock_guard guard(_lock);
+    _facts.counts[record.user().value_or(UserName())].toldToSend = true;
+}
+
+void OutcomeKeeper::applied(const CXDChangeRecord& record, int32_t source) {
+    const std::lock_guard guard(_lock);
+    PassFacts::Counts& counts = _facts.counts[record.user().value_or(UserName())];
+    ++(source == CXDSyncSourceVaultra ? counts.sent : counts.received);
+}
+
+void OutcomeKeeper::refused(const UserName& user) {
+    const std::lock_guard guard(_lock);
+    ++_facts.counts[user].refused;
+}
+
+void OutcomeKeeper::rests(const UserName& user, int64_t changes) {
+    const std::lock_guard guard(_lock);
+    _facts.counts[user].resting = changes;
+}
+
+void OutcomeKeeper::leaves(const CXDChangeRecords& pending) {
+    const std::lock_guard guard(_lock);
+    countLeftOver(_facts, pending);
+}
+
+void OutcomeKeeper::caught(const std::string& exception) {
+    const std::lock_guard guard(_lock);
+    if (!_facts.exception) _facts.exception = exception;
+}
+
+void OutcomeKeeper::couldNotStore(const std::string& exception) {
+    const std::lock_guard guard(_lock);
+    if (!_facts.storage) _facts.storage = exception;
+}
+
+// The failures are taken: a second call adds those that came since.
+void OutcomeKeeper::settle() {
+    _facts.anotherFollows = _sources.anotherFollows && _sources.anotherFollows();
+    try {
+        if (_sources.failures)
+            for (PassFailure& failure : _sources.failures()) _facts.failures.push_back(std::move(failure));
+        if (_sources.shared) _facts.shared = _sources.shared();
+    } catch (const CXException& e) {
+        if (!_facts.storage) _facts.storage = e.reason();
+    }
+}
+
+void OutcomeKeeper::put() {
+    const std::lock_guard guard(_lock);
+    settle();
+    _put = outcomeOf(_facts, _previous, _clock.now());
+    _preferences.set(kDaemonDomain, kCXDPassOutcome, encodeOutcome(*_put));
+}
+
+PassOutcome OutcomeKeeper::end() {
+    const std::lock_guard guard(_lock);
+    _running = false;
+    settle();
+    PassOutcome outcome = outcomeOf(_facts, _previous, _put ? _put->ended : _clock.now());
+    try {
+        if (_put != outcome) {
+            _preferences.set(kDaemonDomain, kCXDPassOutcome, encodeOutcome(outcome));
+            _preferences.synchronize(kDaemonDomain);
+        }
+    } catch (const CXException& e) {
+        // Where the same has ended the pass, it stands in the log already.
+        if (outcome.exception != e.reason()) CXLog("The outcome of the pass could not be stored: %@", e);
+        if (!outcome.storage) outcome.storage = e.reason();
+    }
+    _previous = outcome;
+    return outcome;
+}
+
+PassOutcome OutcomeKeeper::endWithoutAPass(Preferences& preferences, const Clock& clock, const std::string& exception) {
+    OutcomeKeeper keeper(preferences, clock, {});
+    keeper.begin(true, false);
+    keeper.caught(exception);
+    return keeper.end();
+}
+
+} // namespace rolvane

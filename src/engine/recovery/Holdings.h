@@ -1,0 +1,44 @@
+#pragma once
+
+#include "contacts/database/CXRolvane.h"
+#include "contacts/database/DamagedDatabase.h"
+#include "contacts/records/Constants.h"
+#include "contacts/records/Identifier.h"
+#include "engine/queue/ChangeQueue.h"
+
+#include <unordered_map>
+
+namespace rolvane {
+
+// The all-contacts group's list of locations is there and empty while only single groups are published.
+inline bool isPublished(const CXGroup& group) {
+    const auto locations = group.multiValueForProperty(kCXRemoteLocationProperty);
+    return locations && !locations->empty();
+}
+
+// What the database still holds, under the own table or that of the subscribed copies; each identifier is asked for
+// once. What it does not hold is withdrawn from the store, so a damaged database throws CXDamagedDatabase.
+class Holdings {
+public:
+    explicit Holdings(CXRolvane& rolvane) : _rolvane(rolvane), _absences(rolvane) {}
+    bool person(const UniqueId& uid) { return holds(uid, kCXPersonTable, kCXSubscribedPersonTable); }
+    bool group(const UniqueId& uid) {
+        return uid.str() == kCXAllGroupUID || uid == kPeopleGroup || holds(uid, kCXGroupTable, kCXSubscribedGroupTable);
+    }
+
+private:
+    bool holds(const UniqueId& uid, std::string_view table, std::string_view tableOfCopies) {
+        const auto [known, isNew] = _known.try_emplace(uid);
+        if (!isNew) return known->second;
+        const UniqueId own = cxUIDWithTableName(uid, table), copy = cxUIDWithTableName(uid, tableOfCopies);
+        known->second = _rolvane.recordForUniqueId(own) || _rolvane.recordForUniqueId(copy);
+        if (!known->second)
+            for (const UniqueId& form : {own, copy}) _absences.requireGone(form);
+        return known->second;
+    }
+    CXRolvane& _rolvane;
+    AbsenceCheck _absences;
+    std::unordered_map<UniqueId, bool> _known;
+};
+
+} // namespace rolvane

@@ -1,0 +1,156 @@
+#include "store/account/StoreTrial.h"
+
+#include "foundation/Paths.h"
+#include "foundation/PropertyList.h"
+#include "store/dav/CXDAVManagerImpl.h"
+#include "store/dav/Collections.h"
+
+#include <memory>
+#include <utility>
+#include <vector>
+
+namespace rolvane {
+
+namespace {
+
+bool isAny(int) {
+    return true;
+}
+
+// One trial, step by step; what it made goes with it.
+class Trial {
+public:
+    explicit Trial(CXDAVManager::Impl& client) : _session(client.session) {}
+    ~Trial() {
+        for (auto made = _made.rbegin(); made != _made.rend(); ++made) (void)ask("DELETE", *made);
+    }
+    Trial(const Trial&) = delete;
+    Trial& operator=(const Trial&) = delete;
+
+    StoreTrial run() {
+        _found.accessLists = _session.keepsAccessLists().value_or(false);
+        if (makesFolders() && takesFiles() && readsAndLists()) {
+            triesLocks();
+            if (changes()) deletes();
+        }
+        return _found;
+    }
+
+private:
+    using Headers = std::vector<std::pair<std::string, std::string>>;
+
+    HttpResponse ask(const char* method, const Url& url, Headers headers = {}, const std::string& body = {}) {
+        HttpRequest request = StoreSession::request(method, url);
+        request.headers = std::move(headers);
+        if (!body.empty()) request.body = std::make_shared<const std::string>(body);
+        return _session.send(std::move(request), isAny);
+    }
+    HttpResponse put(const std::string& value, Headers headers = {}) {
+        headers.emplace_back("Content-Type", "application/xml; charset=utf-8");
+        return ask("PUT", _file, std::move(headers), PropertyList::toXML(Dictionary{{"Trial", value}}));
+    }
+
+    bool hindered(const std::string& what, const char* method, const HttpResponse& answer) {
+        const std::string said = answer.complete()
+                                     ? std::string(method) + " was answered with " + std::to_string(answer.status)
+                                     : answer.detail;
+        const std::string words = answer.complete() ? serverWords(answer) : std::string();
+        _found.hindrance = {what + " (" + said + (words.empty() ? "" : ": " + words) + ").",
+                            answer.complete() ? answer.status : 0};
+        return false;
+    }
+
+    bool makesFolders() {
+        const CXDAVAccount& account = _session.account();
+        const Url name = account.baseLocationFor(account.user);
+        const Url tree = *_session.collectionEndpoint(name, true);
+        HttpResponse made = ask("MKCOL", tree);
+        if (made.status == 409 || made.status == 404) { // the folders above it are missing
+            std::vector<Url> above;
+            for (Url u = tree.cxURLByDeletingLastComponent(); !u.cxLastComponent().empty();
+                 u = u.cxURLByDeletingLastComponent())
+                above.insert(above.begin(), namedAsCollection(u));
+            for (const Url& u : above)
+                if (ask("MKCOL", u).ok()) _made.push_back(u);
+            made = ask("MKCOL", tree);
+        }
+        if (made.ok()) _made.push_back(tree);
+        const Url folder = namedAsCollection(tree.cxURLByAppendingComponent("trial-" + makeUUID()));
+        made = ask("MKCOL", folder);
+        if (!made.ok()) return hindered("The store makes no folders", "MKCOL", made);
+        _made.push_back(folder);
+        _file = folder.cxURLByAppendingComponent(makeUUID() + ":CXPerson");
+        return true;
+    }
+
+    bool takesFiles() {
+        const HttpResponse written = put("first");
+        return written.ok() || hindered("The store takes no files of this kind", "PUT", written);
+    }
+
+    bool readsAndLists() {
+        const HttpResponse read = ask("GET", _file);
+        if (read.status != 200 || read.body != PropertyList::toXML(Dictionary{{"Trial", "first"}}))
+            return hindered("The store does not give back what was written", "GET", read);
+        const HttpResponse listed = _session.send(StoreSession::propfind(_made.back(), 1), isAny);
+        MultistatusReader reader;
+        const auto entries = listed.status == 207 && reader.feed(listed.body) ? reader.finish() : std::nullopt;
+        if (entries)
+            for (const MultistatusEntry& entry : *entries) {
+                if (entry.isCollection) continue;
+                _found.dates = entry.lastModified.has_value();
+                _found.tags = !entry.etag.empty();
+                return true;
+            }
+        return hindered("The store does not list what was written", "PROPFIND", listed);
+    }
+
+    void triesLocks() {
+        if (!_session.mayKeepLocks()) return;
+        const HttpResponse answer = ask(
+            "LOCK", _file,
+            {{"Depth", "0"}, {"Timeout", "Second-60"}, {"Content-Type", "application/xml; charset=utf-8"}},
+            "<?xml version=\"1.0\" encoding=\"utf-8\"?>\n<lockinfo xmlns=\"DAV:\"><lockscope><exclusive/></lockscope>"
+            "<locktype><write/></locktype><owner>trial</owner></lockinfo>");
+        const auto grant = answer.ok() ? parseLockAnswer(answer.body) : std::nullopt;
+        const std::string token = grant ? grant->token.str() : std::string();
+        if (token.empty() || token.find_first_of("<>\r\n ") != std::string::npos) return;
+        const bool written = put("locked", {{"If", "<" + _file.absoluteString() + "> (<" + token + ">)"}}).ok();
+        const bool released = ask("UNLOCK", _file, {{"Lock-Token", "<" + token + ">"}}).ok();
+        _found.locks = written && released;
+    }
+
+    bool changes() {
+        const HttpResponse changed = put("second");
+        if (!changed.ok()) return hindered("The store does not let a file be changed", "PUT", changed);
+        // Of a version that is not there any more.
+        _found.conditions = put("third", {{"If-Match", "\"no-such-version\""}}).status == 412;
+        return true;
+    }
+
+    void deletes() {
+        const HttpResponse gone = ask("DELETE", _file);
+        if (!gone.ok()) {
+            hindered("The store does not let a file be deleted", "DELETE", gone);
+            return;
+        }
+        const HttpResponse folder = ask("DELETE", _made.back());
+        if (folder.ok())
+            _made.pop_back();
+        else
+            hindered("The store does not let a folder be deleted", "DELETE", folder);
+    }
+
+    StoreSession& _session;
+    StoreTrial _found;
+    std::vector<Url> _made; // from the outside in
+    Url _file;
+};
+
+} // namespace
+
+StoreTrial tryStore(CXDAVManager& store) {
+    return Trial(*store.impl()).run();
+}
+
+} // namespace rolvane

@@ -1,0 +1,300 @@
+#include "store/dav/CXDAVManager.h"
+
+#include "foundation/CXException.h"
+#include "foundation/Log.h"
+#include "foundation/Paths.h"
+#include "store/account/ConfigurationValues.h"
+#include "store/dav/CXDAVManagerImpl.h"
+
+#include <cstdlib>
+#include <strings.h>
+
+namespace rolvane {
+
+namespace {
+
+std::mutex sharedMutex;
+std::shared_ptr<CXDAVManager> sharedManager;
+
+// The saved account, or an empty one, with which every operation fails.
+CXDAVAccount savedAccount() {
+    try {
+        if (auto account = CXDAVAccount::load()) return *account;
+    } catch (const CXException& e) {
+        CXLog("%@", e.reason());
+    }
+    return {};
+}
+
+std::string versionMemoryPath() {
+    try {
+        return cacheDirectory() + "/versions";
+    } catch (const CXException& e) {
+        CXLog("Versions are remembered in memory only: %@", e.reason());
+        return {};
+    }
+}
+
+// What every name in the account's own tree begins with; without an account, what no name begins with.
+std::string treeOf(const CXDAVAccount& account) {
+    return account.user.empty() ? "\n" : account.baseLocationFor(account.user).absoluteString() + "/";
+}
+
+bool isSecure(const Url& url) {
+    return strcasecmp(url.scheme().c_str(), "https") == 0;
+}
+
+void setCode(int* code, int value) {
+    if (code) *code = value;
+}
+
+} // namespace
+
+CXDAVManager::Impl::Impl(CXDAVAccount account, std::shared_ptr<HttpTransport> transport, CurlTransport* signsIn,
+                         std::string versionsPath)
+    : versions(std::move(versionsPath)), session(std::move(account), std::move(transport), signsIn),
+      files(session, tokens, versions), structure(session, files), accessLists(session),
+      ownTree(treeOf(session.account())) {}
+
+StoreFiles::Reading CXDAVManager::Impl::read(const Url& name, bool securely) {
+    const auto endsATree = [](int code) { return code == 403 || code == 404; };
+    StoreFiles::Reading once = files.read(name, securely);
+    const Url tree = name.cxURLByDeletingLastComponent();
+    const bool isInfo = name.cxLastComponent() == "info" && tree.pathComponents().size() == 3; // "/", user, "Contacts"
+    if (!isInfo || !endsATree(once.code)) return once;
+    CXDLog("%@ was answered with %d. It is asked once more.", name, once.code);
+    if (!session.provesItself()) return {};
+    if (tree.absoluteString() + "/" == ownTree) structure.check(true);
+    return files.read(name, securely);
+}
+
+StoreListing::AskedRef CXDAVManager::Impl::begun(const Url& container) {
+    const std::lock_guard guard(begunLock);
+    const auto found = begunListings.find(container.absoluteString());
+    if (found == begunListings.end()) return nullptr;
+    auto listing = std::move(found->second);
+    begunListings.erase(found);
+    return listing;
+}
+
+CXDAVManager::CXDAVManager(CXDAVAccount account) : CXDAVManager(std::move(account), VersionsFile()) {}
+
+CXDAVManager::CXDAVManager(CXDAVAccount account, VersionsFile versions) {
+    std::shared_ptr<CurlTransport> transport = makeAccountTransport(account);
+    CurlTransport* signsIn = transport.get();
+    _impl = std::make_shared<Impl>(std::move(account), std::move(transport), signsIn, std::move(versions.path));
+}
+
+CXDAVManager::CXDAVManager(CXDAVAccount account, std::shared_ptr<HttpTransport> transport)
+    : CXDAVManager(std::move(account), std::move(transport), VersionsFile()) {}
+
+CXDAVManager::CXDAVManager(CXDAVAccount account, std::shared_ptr<HttpTransport> transport, VersionsFile versions)
+    : _impl(std::make_shared<Impl>(std::move(account), std::move(transport), nullptr, std::move(versions.path))) {}
+
+CXDAVManager::~CXDAVManager() = default;
+
+const CXDAVAccount& CXDAVManager::account() const {
+    return _impl->session.account();
+}
+HttpTransport& CXDAVManager::transport() {
+    return _impl->session.transport();
+}
+
+RequestFailures& CXDAVManager::failures() {
+    return _impl->session.failures();
+}
+
+// ---- the process's own
+
+static std::shared_ptr<CXDAVManager> shared() {
+    std::lock_guard guard(sharedMutex);
+    if (!sharedManager) {
+        sharedManager = std::make_shared<CXDAVManager>(savedAccount(), CXDAVManager::VersionsFile{versionMemoryPath()});
+        // Now, when the TLS library has put its own end in the list: connections have to be closed before it goes.
+        [[maybe_unused]] static const int once = std::atexit([] { CXDAVManager::setDefaultManager(nullptr); });
+    }
+    return sharedManager;
+}
+
+CXDAVManager& CXDAVManager::defaultManager() {
+    return *shared();
+}
+
+void CXDAVManager::setDefaultManager(std::shared_ptr<CXDAVManager> manager) {
+    std::lock_guard guard(sharedMutex);
+    std::swap(sharedManager, manager);
+}
+
+std::string CXDAVManager::vaultraUser() {
+    return shared()->account().user.str();
+}
+std::string CXDAVManager::password() {
+    return shared()->_impl->session.password().value_or("");
+}
+std::string CXDAVManager::ostrelUserAgent() {
+    return "Rolvane/" ROLVANE_VERSION;
+}
+
+std::string CXDAVManager::vaultraAddress() {
+    const auto origins = shared()->account().origins();
+    return origins.empty() ? "" : Url(origins.front() + "/").host();
+}
+
+bool CXDAVManager::canReachOstrelError(CXDAVError& error) {
+    return shared()->canReach(error);
+}
+
+Url CXDAVManager::ostrelBaseLocationForOstrelUser(const UserName& user) {
+    const auto manager = shared();
+    if (manager->account().user.empty()) return {};
+    return manager->account().baseLocationFor(user);
+}
+
+void CXDAVManager::updateConfigDataIfNeeded() {
+    ConfigurationValues::shared().updateIfNeeded();
+}
+
+Value CXDAVManager::configValueForKey(const std::string& key, Value defaultValue) {
+    return ConfigurationValues::shared().valueForKey(key, std::move(defaultValue));
+}
+
+// ---- one client
+
+bool CXDAVManager::canReach(CXDAVError& error, const std::function<void()>& meanwhile) {
+    if (account().user.empty()) {
+        error = {kCXDAVErrorNoAccount, "There is no account. Set one with: rolvane account set"};
+        return false;
+    }
+    return _impl->session.canReach(error, meanwhile);
+}
+
+bool CXDAVManager::write(const std::string& text, const Url& url, bool securely) {
+    return write(text, url, securely, nullptr);
+}
+
+bool CXDAVManager::write(const std::string& text, const Url& url, bool securely, int* code) {
+    const bool isOwn = url.absoluteString().starts_with(_impl->ownTree);
+    const int status = _impl->files.write(
+        url, text, securely, isOwn ? std::function<bool()>([this] { return _impl->structure.repair(); }) : nullptr);
+    setCode(code, status);
+    return StoreFiles::succeeded(status);
+}
+
+std::optional<Date> CXDAVManager::modDateForURL(const Url& url) {
+    return _impl->files.modificationDate(url);
+}
+
+std::optional<Dictionary> CXDAVManager::dictionaryAtURL(const Url& url, bool securely, int* code) {
+    auto reading = _impl->read(url, securely);
+    setCode(code, reading.code);
+    return std::move(reading.dictionary);
+}
+
+CXDAVManager::Version CXDAVManager::readVersion(const Url& url, bool securely, int* code) {
+    auto reading = _impl->files.read(url, securely);
+    setCode(code, reading.code);
+    return {std::move(reading.dictionary), reading.isKnown, reading.lastModified, reading.failed};
+}
+
+bool CXDAVManager::remembersVersion(const Url& url) const {
+    return _impl->versions.remembers(url.absoluteString());
+}
+
+std::optional<Dictionary> CXDAVManager::dictionaryAtURL(const Url& url, int* errorCode, bool securely) {
+    return dictionaryAtURL(url, securely, errorCode);
+}
+
+bool CXDAVManager::removeFileAtURL(const Url& url, int* code) {
+    const int status = _impl->files.remove(url);
+    setCode(code, status);
+    return StoreFiles::succeeded(status) || status == 404;
+}
+
+bool CXDAVManager::removeDirectoryAndContentsAtURL(const Url& url) {
+    return removeFileAtURL(url, nullptr);
+}
+bool CXDAVManager::createDirectoryAtAURL(const Url& url) {
+    return _impl->files.makeCollection(url);
+}
+
+std::optional<FileListing> CXDAVManager::infoForFilesInContainer(const Url& url) {
+    return infoForFilesInContainerByParts(url, nullptr);
+}
+
+std::optional<FileListing> CXDAVManager::infoForFilesInContainerByParts(const Url& url, const ListingPart& part) {
+    auto listing = StoreListing(_impl->session, _impl->versions, _impl->listings).list(url, _impl->begun(url), part);
+    if (!listing) return listing;
+    for (const auto& [path, file] : *listing) {
+        if (!file.displayName.ends_with("CXGroup")) continue;
+        const Url group = url.cxURLByAppendingComponent(file.displayName);
+        if (file.isCollection) _impl->files.foundCollection(group);
+        if (file.seen) _impl->files.copies().foundUnchanged(group.absoluteString());
+    }
+    return listing;
+}
+
+void CXDAVManager::expectReads(const std::vector<Url>& urls, bool securely) {
+    _impl->files.expectReads(urls, securely);
+}
+
+void CXDAVManager::expectSomeReads(const std::vector<Url>& urls, bool securely) {
+    _impl->files.expectSomeReads(urls, securely);
+}
+
+void CXDAVManager::expectListing(const Url& url) {
+    auto begun = StoreListing(_impl->session, _impl->versions, _impl->listings).begin(url);
+    const std::lock_guard guard(_impl->begunLock);
+    _impl->begunListings.insert_or_assign(url.absoluteString(), std::move(begun));
+}
+
+void CXDAVManager::expectNothing() {
+    _impl->files.expectNoReads();
+    const std::lock_guard guard(_impl->begunLock);
+    _impl->begunListings.clear();
+}
+
+CXDAVManager::Snapshot::Snapshot(CXDAVManager& manager) : _impl(manager._impl) {
+    _impl->files.copies().beginSnapshot();
+}
+CXDAVManager::Snapshot::~Snapshot() {
+    _impl->files.copies().endSnapshot();
+}
+
+void CXDAVManager::keepSerialNumber(const std::string& serial) {
+    _impl->structure.keepSerialNumber(serial);
+}
+bool CXDAVManager::sanityCheckPublishStructureCreate(bool create) {
+    return !account().user.empty() && _impl->structure.check(create);
+}
+
+std::optional<bool> CXDAVManager::keepsAccessLists() {
+    return _impl->session.keepsAccessLists();
+}
+
+bool CXDAVManager::ACLsAtURL(const Url& url, std::vector<std::string>& readers, std::vector<std::string>& writers) {
+    auto found = _impl->accessLists.read(url, isSecure(url));
+    if (!found) return false;
+    readers = std::move(found->readers);
+    writers = std::move(found->writers);
+    return true;
+}
+
+bool CXDAVManager::setACLsWithReadPrincipals(const std::vector<std::string>& readers,
+                                             const std::vector<std::string>& writers, const Url& url) {
+    return _impl->accessLists.set(url, isSecure(url), {readers, writers});
+}
+
+void CXDAVManager::saveVersionMemory() {
+    _impl->versions.save();
+}
+void CXDAVManager::forgetVersion(const Url& url) {
+    _impl->versions.forget(url.absoluteString());
+}
+void CXDAVManager::networkChanged() {
+    _impl->session.transport().networkChanged();
+}
+void CXDAVManager::abortAll() {
+    _impl->session.transport().abortAll();
+}
+
+} // namespace rolvane

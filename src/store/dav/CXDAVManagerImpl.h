@@ -1,0 +1,41 @@
+#pragma once
+
+#include "store/dav/CXDAVManager.h"
+#include "store/dav/StoreAccessLists.h"
+#include "store/files/PublishStructure.h"
+#include "store/files/StoreFiles.h"
+#include "store/files/StoreListing.h"
+#include "store/http/StoreSession.h"
+#include "store/locks/LockTokens.h"
+#include "store/reads/VersionMemory.h"
+
+#include <map>
+#include <mutex>
+
+namespace rolvane {
+
+// What a client is made of, in the order in which its parts need one another.
+struct CXDAVManager::Impl {
+    Impl(CXDAVAccount account, std::shared_ptr<HttpTransport> transport, CurlTransport* signsIn,
+         std::string versionsPath);
+
+    LockTokens tokens;
+    VersionMemory versions;
+    ListingMemory listings;
+    StoreSession session;
+    StoreFiles files;
+    PublishStructure structure;
+    StoreAccessLists accessLists;
+    const std::string ownTree; // what every name below the account's own tree begins with
+
+    // Reads a dictionary. That a tree's "info" is forbidden or absent, which ends a publication or a subscription, is
+    // told only when the store says it twice; in between it shows that it is a WebDAV server, and its owner's client
+    // looks after the tree's structure.
+    StoreFiles::Reading read(const Url& name, bool securely);
+
+    std::mutex begunLock;
+    std::map<std::string, StoreListing::AskedRef> begunListings; // by container; guarded by begunLock
+    StoreListing::AskedRef begun(const Url& container);          // hands it out; null when there is none
+};
+
+} // namespace rolvane

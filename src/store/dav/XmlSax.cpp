@@ -1,0 +1,123 @@
+#include "store/dav/XmlSax.h"
+
+#include <algorithm>
+#include <new>
+
+namespace rolvane {
+
+namespace {
+
+void silent(void*, const char*, ...) {}
+void silentStructured(void*, xmlErrorPtr) {}
+
+// libxml2 hands an ampersand in the value of an attribute over as "&#38;".
+std::string plainURI(std::string_view uri) {
+    constexpr std::string_view kAmpersand = "&#38;";
+    std::string out;
+    for (size_t at = 0; at < uri.size();) {
+        out += uri[at];
+        at += uri.substr(at).starts_with(kAmpersand) ? kAmpersand.size() : 1;
+    }
+    return out;
+}
+
+} // namespace
+
+XmlSax::XmlSax(int maxDepth) : _maxDepth(static_cast<size_t>(maxDepth)) {
+    _handler.initialized = XML_SAX2_MAGIC;
+    _handler.startElementNs = &XmlSax::onStart;
+    _handler.endElementNs = &XmlSax::onEnd;
+    _handler.characters = &XmlSax::onText;
+    _handler.cdataBlock = &XmlSax::onText;
+    // A document type that only has a name says nothing; what one declares could change all that follows.
+    _handler.entityDecl = &XmlSax::onEntity;
+    _handler.attributeDecl = &XmlSax::onAttribute;
+    _handler.elementDecl = &XmlSax::onElement;
+    _handler.notationDecl = &XmlSax::onNotation;
+    _handler.unparsedEntityDecl = &XmlSax::onUnparsed;
+    _handler.reference = &XmlSax::onReference;
+    _handler.warning = &silent;
+    _handler.error = &silent;
+    _handler.serror = &silentStructured;
+    _context = xmlCreatePushParserCtxt(&_handler, this, nullptr, 0, nullptr);
+    if (!_context) throw std::bad_alloc();
+    xmlCtxtUseOptions(_context, XML_PARSE_NONET | XML_PARSE_NOERROR | XML_PARSE_NOWARNING);
+}
+
+// Where entities are declared the parser makes a document of its own for them, which a push parser leaves to its user.
+XmlSax::~XmlSax() {
+    if (_context->myDoc) xmlFreeDoc(_context->myDoc);
+    xmlFreeParserCtxt(_context);
+}
+
+bool XmlSax::feed(std::string_view bytes) {
+    while (_good && !bytes.empty()) {
+        const size_t n = std::min<size_t>(bytes.size(), 1u << 20);
+        if (xmlParseChunk(_context, bytes.data(), static_cast<int>(n), 0) != 0) _good = false;
+        bytes.remove_prefix(n);
+    }
+    return _good;
+}
+
+bool XmlSax::finish() {
+    if (_good && xmlParseChunk(_context, nullptr, 0, 1) != 0) _good = false;
+    return _good && _context->wellFormed == 1;
+}
+
+void XmlSax::refuse() {
+    _good = false;
+    xmlStopParser(_context);
+}
+
+void XmlSax::onStart(void* self, const xmlChar* local, const xmlChar* prefix, const xmlChar* uri, int, const xmlChar**,
+                     int, int, const xmlChar**) {
+    auto* sax = static_cast<XmlSax*>(self);
+    if (!sax->_good) return;
+    const std::string_view space = uri ? reinterpret_cast<const char*>(uri) : "";
+    std::string name = reinterpret_cast<const char*>(local);
+    // A name with a prefix that nobody declared, or with half of one, belongs nowhere.
+    if ((prefix && !uri) || name.find(':') != std::string::npos) return sax->refuse();
+    if (space != "DAV:") name = "{" + plainURI(space) + "}" + name;
+    sax->_path.push_back(std::move(name));
+    if (sax->_path.size() > sax->_maxDepth || !sax->opened(sax->_path)) sax->refuse();
+}
+
+void XmlSax::onEnd(void* self, const xmlChar*, const xmlChar*, const xmlChar*) {
+    auto* sax = static_cast<XmlSax*>(self);
+    if (!sax->_good || sax->_path.empty()) return;
+    if (!sax->closed(sax->_path)) sax->refuse();
+    sax->_path.pop_back();
+}
+
+void XmlSax::onText(void* self, const xmlChar* characters, int length) {
+    auto* sax = static_cast<XmlSax*>(self);
+    if (!sax->_good) return;
+    if (!sax->text({reinterpret_cast<const char*>(characters), static_cast<size_t>(length)})) sax->refuse();
+}
+
+void XmlSax::onReference(void* self, const xmlChar*) {
+    static_cast<XmlSax*>(self)->refuse();
+}
+
+void XmlSax::onEntity(void* self, const xmlChar*, int, const xmlChar*, const xmlChar*, xmlChar*) {
+    static_cast<XmlSax*>(self)->refuse();
+}
+
+void XmlSax::onAttribute(void* self, const xmlChar*, const xmlChar*, int, int, const xmlChar*, xmlEnumerationPtr tree) {
+    xmlFreeEnumeration(tree); // it is handed over
+    static_cast<XmlSax*>(self)->refuse();
+}
+
+void XmlSax::onElement(void* self, const xmlChar*, int, xmlElementContentPtr) {
+    static_cast<XmlSax*>(self)->refuse();
+}
+
+void XmlSax::onNotation(void* self, const xmlChar*, const xmlChar*, const xmlChar*) {
+    static_cast<XmlSax*>(self)->refuse();
+}
+
+void XmlSax::onUnparsed(void* self, const xmlChar*, const xmlChar*, const xmlChar*, const xmlChar*) {
+    static_cast<XmlSax*>(self)->refuse();
+}
+
+} // namespace rolvane

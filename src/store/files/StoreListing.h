@@ -1,0 +1,64 @@
+#pragma once
+
+#include "store/dav/Multistatus.h"
+#include "store/files/CXFileManager.h"
+#include "store/http/StoreSession.h"
+#include "store/reads/ListingMemory.h"
+#include "store/reads/VersionMemory.h"
+
+#include <memory>
+#include <optional>
+#include <vector>
+
+namespace rolvane {
+
+// Lists containers of a store, one PROPFIND of depth 1 a collection, in parallel; of the buckets of a tree only those
+// whose tag says that they have changed since they were listed last. Complete or nothing. Any thread.
+class StoreListing {
+public:
+    StoreListing(StoreSession& session, VersionMemory& versions, ListingMemory& listings)
+        : _session(session), _versions(versions), _listings(listings) {}
+
+    // How much later than the listing a version is dated that this client has neither read nor written: whoever
+    // compares with the date of the last sync leaves a margin, and the version must lie behind that in this very
+    // listing.
+    static constexpr double kUnseenSeconds = 5;
+
+    // Containers that the store was asked to list, with the answers as they come.
+    struct Asked;
+    using AskedRef = std::shared_ptr<Asked>;
+    // What `list` of the container asks first. Does not wait.
+    AskedRef begin(const Url& container);
+    // As CXFileManager::infoForFilesInContainer; `begun`: goes on from there; `part`: as of
+    // infoForFilesInContainerByParts.
+    std::optional<FileListing> list(const Url& container, const AskedRef& begun = {},
+                                    const CXFileManager::ListingPart& part = {});
+    // The names of the direct members of each container, with what they are. Nothing for a container that cannot be
+    // listed; `codes` tells why.
+    struct Members {
+        int code = 0;
+        std::optional<std::vector<std::pair<Url, MultistatusEntry>>> entries; // by name; the container itself left out
+        std::optional<Date> serverDate;
+    };
+    std::vector<Members> members(const std::vector<Url>& containers);
+
+private:
+    // `tagged`: of that one's members the tags are asked for, too.
+    AskedRef ask(const std::vector<Url>& containers, const Url* tagged = nullptr);
+    Members read(Asked& asked, size_t number); // of an answer that has come
+    std::vector<Members> readAll(Asked& asked);
+    bool isEmptyCollection(const Url& place);
+    bool addBuckets(const Members& people, bool tagged, FileListing& out, const CXFileManager::ListingPart& part);
+    bool addUnchanged(const Url& container, const std::string& tag, const std::optional<Date>& serverDate,
+                      FileListing& out);
+    bool addEntries(const Members& members, FileListing& out, std::vector<Url>& groupCollections);
+    bool addStates(const std::vector<Url>& groups, FileListing& out);
+    void stamp(std::string_view name, const MultistatusEntry& entry, const std::optional<Date>& serverDate,
+               FileInfo& info);
+
+    StoreSession& _session;
+    VersionMemory& _versions;
+    ListingMemory& _listings;
+};
+
+} // namespace rolvane

@@ -1,0 +1,49 @@
+#include "store/reads/ListingMemory.h"
+
+namespace rolvane {
+
+ListingMemory::Container ListingMemory::packed(const Entries& entries) {
+    Container out;
+    out.rows.reserve(entries.size());
+    for (const auto& [url, entry] : entries) {
+        const std::string& whole = url.absoluteString();
+        const std::string_view name = std::string_view(whole).substr(whole.rfind('/') + 1);
+        const std::string& tag = entry.etag.str();
+        out.rows.push_back({static_cast<uint32_t>(out.text.size()), static_cast<uint32_t>(name.size()),
+                            static_cast<uint32_t>(tag.size()), entry.isCollection, entry.lastModified.has_value(),
+                            entry.length.has_value(), entry.lastModified ? entry.lastModified->secondsSince1970() : 0,
+                            entry.length.value_or(0)});
+        out.text.append(name).append(tag);
+    }
+    return out;
+}
+
+ListingMemory::Member ListingMemory::unpacked(const Container& container, const Row& row) {
+    const std::string_view text = container.text;
+    Member member{text.substr(row.at, row.nameLength), {}};
+    member.entry.isCollection = row.isCollection;
+    if (row.hasDate) member.entry.lastModified = Date(row.modified);
+    if (row.hasLength) member.entry.length = row.length;
+    member.entry.etag = EntityTag(std::string(text.substr(row.at + row.nameLength, row.tagLength)));
+    return member;
+}
+
+void ListingMemory::keep(const Url& container, const std::string& tag, const Entries& entries) {
+    Container fresh;
+    if (!tag.empty()) fresh = packed(entries);
+    fresh.tag = tag;
+    const std::lock_guard guard(_mutex);
+    if (const auto old = _containers.find(container.absoluteString()); old != _containers.end()) {
+        _bytes -= old->second.bytes();
+        _containers.erase(old);
+    }
+    if (tag.empty() || fresh.bytes() > kMostBytes) return;
+    if (_bytes + fresh.bytes() > kMostBytes) {
+        _containers.clear();
+        _bytes = 0;
+    }
+    _bytes += fresh.bytes();
+    _containers.emplace(container.absoluteString(), std::move(fresh));
+}
+
+} // namespace rolvane

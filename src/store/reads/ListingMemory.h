@@ -1,0 +1,64 @@
+#pragma once
+
+#include "store/dav/Multistatus.h"
+
+#include "foundation/Url.h"
+
+#include <cstdint>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <unordered_map>
+#include <utility>
+#include <vector>
+
+namespace rolvane {
+
+// The members of collections as the store listed them last, each with the tag that it gave for the state of the
+// collection's members before that listing: a collection that still has the tag need not be listed again. In memory
+// only, bounded: past kMostBytes it forgets everything. Any thread.
+class ListingMemory {
+public:
+    using Entries = std::vector<std::pair<Url, MultistatusEntry>>; // direct members of the container
+    static constexpr size_t kMostBytes = 64u << 20;
+
+    // Replaces what was kept of the container. Without a tag nothing is kept.
+    void keep(const Url& container, const std::string& tag, const Entries& entries);
+
+    struct Member {
+        std::string_view encodedName; // the last component of the URL, as written
+        MultistatusEntry entry;       // without href and status
+    };
+    // Calls back for each member, in the order of the listing, if the container still has the tag; false if not. The
+    // name lives for the time of the call.
+    template <class Take>
+    bool forEach(const Url& container, const std::string& tag, Take take) const {
+        const std::lock_guard guard(_mutex);
+        const auto found = _containers.find(container.absoluteString());
+        if (tag.empty() || found == _containers.end() || found->second.tag != tag) return false;
+        for (const Row& row : found->second.rows) take(unpacked(found->second, row));
+        return true;
+    }
+
+private:
+    struct Row {
+        uint32_t at, nameLength, tagLength; // in the text: the name, then the entity tag
+        bool isCollection, hasDate, hasLength;
+        double modified; // seconds since 1970
+        uint64_t length;
+    };
+    struct Container {
+        std::string tag, text;
+        std::vector<Row> rows;
+        size_t bytes() const { return text.size() + rows.size() * sizeof(Row); }
+    };
+    static Member unpacked(const Container& container, const Row& row);
+    static Container packed(const Entries& entries);
+
+    mutable std::mutex _mutex; // guards the following
+    std::unordered_map<std::string, Container> _containers;
+    size_t _bytes = 0;
+};
+
+} // namespace rolvane
