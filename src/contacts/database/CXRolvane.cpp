@@ -34,8 +34,8 @@ CXRolvane::Impl::Impl(CXRolvane& owner, Options given)
       center(options.center ? *options.center : NotificationCenter::defaultCenter()),
       sqlite(RecordStore::makeIfMissing(options.path, options.busyTimeoutMilliseconds),
              options.busyTimeoutMilliseconds),
-      store(sqlite), journal(sqlite), commonVersions(sqlite), conflicts(sqlite), identity(store.identity()),
-      anchor(std::make_shared<CXRolvane* const>(&owner)) {}
+      store(sqlite), journal(sqlite), commonVersions(sqlite), conflicts(sqlite), formerVersions(sqlite),
+      identity(store.identity()), anchor(std::make_shared<CXRolvane* const>(&owner)) {}
 
 CXRolvane::CXRolvane(Options options) : _impl(std::make_unique<Impl>(*this, std::move(options))) {
     if (!_impl->options.runLoop) return;
@@ -147,6 +147,11 @@ bool CXRolvane::save() {
     return true;
 }
 
+bool CXRolvane::saveIfStill(const std::vector<CXExpected>& expected) {
+    std::lock_guard lock(_impl->mutex);
+    return _impl->save(expected);
+}
+
 bool CXRolvane::hasUnsavedChanges() const {
     std::lock_guard lock(_impl->mutex);
     return !_impl->work.empty();
@@ -169,6 +174,10 @@ std::string CXRolvane::databaseIdentity() const {
 }
 const std::string& CXRolvane::path() const {
     return _impl->options.path;
+}
+bool CXRolvane::isOfPast() const {
+    std::lock_guard lock(_impl->mutex);
+    return _impl->sqlite.hasMoved();
 }
 const std::string& CXRolvane::programName() const {
     return _impl->options.program;

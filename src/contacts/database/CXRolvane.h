@@ -50,6 +50,12 @@ struct CXJournalEntry {
     Date date; // of the save; equal to the modification date that the save gave its records
 };
 
+// What a record is taken to be when it is written.
+struct CXExpected {
+    UniqueId uniqueId;
+    std::optional<Date> modified; // nothing: there is no such record
+};
+
 // The contact database: one SQLite file (WAL, synchronous=FULL, mode 0600, directory 0700), shared by all processes of
 // a user. Unsaved changes live in this object's unit of work: every query of this process shows them, no other process
 // does, and no lock is held for them. `save` writes them, the journal and the dates in one short transaction.
@@ -144,6 +150,9 @@ public:
     // whole their changes to any. Of two processes that subscribe to one location at a time, the first one's
     // subscription stays. True always; throws on failure.
     bool save();
+    // The same, where every one of these records is still as it is taken to be; looked at in the transaction. False,
+    // with nothing written and the unsaved changes as they were, where one is not.
+    bool saveIfStill(const std::vector<CXExpected>& expected);
     bool hasUnsavedChanges() const;
     size_t unsavedSize() const; // bytes of content that wait in memory for the save, roughly
     void rollback();            // drops the unsaved changes; handles of records that were only added become empty
@@ -165,6 +174,12 @@ public:
     std::optional<CXConflict> conflict(int64_t number);
     bool forgetConflict(int64_t number); // durable on return; false when there is none
 
+    // From the first call on, every program that saves an edit of a person keeps what the person was before (of 1,000
+    // edits). Durable on return.
+    void keepFormerVersions();
+    // The encoded properties of that time; null when they are the present ones or not known.
+    std::shared_ptr<const Bytes> formerVersion(const UniqueId& uid, Date at);
+
     // Identity and share count -----------------------------------------------------------------------------------
     // Made with the file, kept through everything but a new file.
     std::string databaseIdentity() const;
@@ -179,6 +194,7 @@ public:
     // stored there, and whether this program has saved to this very database since.
     Dictionary historyMark();
     bool hasSavedSince(const Dictionary& mark);
+    bool isOfHistory(const Dictionary& mark); // false for another database, and for an earlier copy of this one
     // At the daemon's start, before any check of the share count: completes a bump that a crash interrupted, if the
     // database still is the one that the intent was made for. Any other database keeps its own count and thus differs.
     void recoverShareCount(Preferences& preferences);
@@ -212,6 +228,7 @@ public:
     std::vector<CXJournalEntry> journalEntries(int64_t after, size_t limit = 1000);
 
     const std::string& path() const;
+    bool isOfPast() const; // another file has its path by now, or none: nothing can be saved any more
     const std::string& programName() const;
 
     struct Impl; // the framework's own; see RolvaneImpl.h

@@ -7,6 +7,7 @@ namespace rolvane {
 namespace {
 
 constexpr int kSavesKept = 1000;
+constexpr int64_t kBooksMayLag = 10000; // entries
 
 CXJournalEntry entryAt(const Sqlite::Statement& s) {
     return {s.integer(0), UniqueId(s.text(1)), static_cast<CXChangeKind>(s.integer(2)),
@@ -106,9 +107,15 @@ void Journal::note(int64_t save, const UniqueId& uid, CXChangeKind kind) {
 }
 
 void Journal::prune() {
-    // Without any cursor nobody reads the journal: who comes later starts with a full scan.
-    int64_t passed = _database.integer("SELECT coalesce((SELECT min(seq) FROM cursors), "
-                                       "(SELECT max(seq) - 1000 FROM journal), 0)");
+    // Without any cursor nobody reads the journal: who comes later starts with a full scan. So does the server of the
+    // address books when it has not been asked for long.
+    int64_t passed = 0;
+    {
+        auto s = _database.statement(
+            "SELECT coalesce((SELECT min(CASE program WHEN ?1 THEN max(seq, (SELECT max(seq) FROM journal) - ?2) "
+            "ELSE seq END) FROM cursors), (SELECT max(seq) - 1000 FROM journal), 0)");
+        if (s.bind(1, kCXBooksProgram).bind(2, kBooksMayLag).step()) passed = s.integer(0);
+    }
     _database.statement("DELETE FROM journal WHERE seq<=?").bind(1, passed).run();
     int64_t needed = _database.integer("SELECT coalesce((SELECT save FROM journal ORDER BY seq LIMIT 1), 1 << 62)");
     auto s = _database.statement("DELETE FROM saves WHERE id<? AND id<=(SELECT max(id) FROM saves)-?");

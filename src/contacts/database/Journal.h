@@ -7,6 +7,9 @@
 
 namespace rolvane {
 
+// The program that serves the address books; where its journal ends it compares everything.
+inline constexpr std::string_view kCXBooksProgram = "books";
+
 // The journal of saves and the programs' cursors in it. Not locked. A save is one row of "saves" (who, when, a random
 // token that tells histories apart) with one "journal" row per changed record; sequences grow and are never used again.
 class Journal {

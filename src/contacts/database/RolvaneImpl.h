@@ -4,6 +4,7 @@
 #include "contacts/database/ChangeWatcher.h"
 #include "contacts/database/CommonVersions.h"
 #include "contacts/database/ConflictLog.h"
+#include "contacts/database/FormerVersions.h"
 #include "contacts/database/Journal.h"
 #include "contacts/database/RecordStore.h"
 #include "contacts/database/SharedForms.h"
@@ -29,6 +30,7 @@ struct CXRolvane::Impl {
     Journal journal;
     CommonVersions commonVersions;
     ConflictLog conflicts;
+    FormerVersions formerVersions;
     UnitOfWork work;
     std::string identity;
     std::shared_ptr<CXRolvane* const> anchor; // handles hold it weakly
@@ -84,7 +86,7 @@ struct CXRolvane::Impl {
     bool unlist(const UniqueId& group, const UniqueId& member);
     void setChoice(const UniqueId& group, const UniqueId& person, const std::string& property,
                    const std::optional<std::string>& identifier);
-    void save();
+    bool save(const std::vector<CXExpected>& expected = {}); // false: a record is not as expected
 
     int64_t cursor(); // registers the program's cursor when there is none
 

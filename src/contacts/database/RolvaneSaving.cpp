@@ -17,8 +17,8 @@ class Saver {
 public:
     Saver(CXRolvane::Impl& database, Date date)
         : _store(database.store), _journal(database.journal), _commonVersions(database.commonVersions),
-          _conflicts(database.conflicts), _identity(database.identity), _program(database.options.program),
-          _date(date) {}
+          _conflicts(database.conflicts), _formerVersions(database.formerVersions), _identity(database.identity),
+          _program(database.options.program), _date(date) {}
 
     void write(const UnitOfWork& work) {
         _work = &work;
@@ -32,6 +32,7 @@ public:
         for (const CXConflict& conflict : work.conflicts()) _conflicts.note(conflict);
         if (work.shareCount()) _store.setShareCount(*work.shareCount());
         if (_save) _journal.prune();
+        if (_keptFormer) _formerVersions.prune();
     }
     bool changedRecords() const { return _save != 0; }
 
@@ -125,10 +126,19 @@ private:
         if (encoded == *row.properties && record.kind == row.kind) return; // nothing has changed after all
         if (isPerson(row.kind) && !_work->commonVersions().contains(uid))
             _commonVersions.keep(row.id, *row.properties, _date);
+        keepFormer(row);
         _store.updateRow(row.id, record.kind, after, encoded, _date,
                          changedMeanwhile ? row.writer : _program); // it holds an edit of theirs
         note(record.kind == RecordKind::allGroup ? UniqueId(_identity + ":" + std::string(kCXInfoTable)) : uid,
              CXChangeKind::updated);
+    }
+
+    void keepFormer(const StoredRow& row) {
+        if (!isPerson(row.kind)) return;
+        if (!_areFormerKept) _areFormerKept = _formerVersions.areKept();
+        if (!*_areFormerKept) return;
+        _formerVersions.keep(row.uid, row.modified, _date, *row.properties);
+        _keptFormer = true;
     }
 
     // All that leaves before all that joins: of groups that are turned round, one can only come below the other when
@@ -199,11 +209,14 @@ private:
     Journal& _journal;
     CommonVersions& _commonVersions;
     ConflictLog& _conflicts;
+    FormerVersions& _formerVersions;
     const std::string& _identity;
     const std::string& _program;
     Date _date;
     const UnitOfWork* _work = nullptr;
     int64_t _save = 0;
+    std::optional<bool> _areFormerKept;
+    bool _keptFormer = false;
     std::set<UniqueId> _noted;
 };
 
@@ -216,12 +229,16 @@ void CXRolvane::Impl::requireSameFile() const {
                                                     "Start this program again.");
 }
 
-void CXRolvane::Impl::save() {
-    if (work.empty()) return;
+bool CXRolvane::Impl::save(const std::vector<CXExpected>& expected) {
+    if (work.empty() && expected.empty()) return true;
     requireSameFile();
     bool changedRecords;
     {
         SqliteTransaction transaction(sqlite);
+        for (const auto& [uid, when] : expected) {
+            const std::optional<StoredRow> row = store.row(uid);
+            if (row ? row->modified != when : when.has_value()) return false;
+        }
         Saver saver(*this, clock.now());
         saver.write(work);
         transaction.commit();
@@ -229,7 +246,7 @@ void CXRolvane::Impl::save() {
     }
     work.clear();
     store.noteOwnWrite();
-    if (!changedRecords) return;
+    if (!changedRecords) return true;
     ChangeWatcher::touch(options.path);
     if (options.distributed)
         options.distributed->post({kCXDatabaseChangedDistributedNotification,
@@ -237,6 +254,7 @@ void CXRolvane::Impl::save() {
                                    {{kCXDatabasePathKey, options.path},
                                     {kCXDatabaseIdentityKey, identity},
                                     {kCXSenderProcessID, static_cast<int64_t>(::getpid())}}});
+    return true;
 }
 
 } // namespace rolvane

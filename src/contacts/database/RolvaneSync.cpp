@@ -42,17 +42,30 @@ Dictionary CXRolvane::historyMark() {
             {"token", _impl->journal.latestToken()}};
 }
 
-bool CXRolvane::hasSavedSince(const Dictionary& mark) {
+bool CXRolvane::isOfHistory(const Dictionary& mark) {
     std::lock_guard lock(_impl->mutex);
     const std::string& token = mark["token"].string();
-    if (mark["identity"].string() != databaseIdentity()) return false;
-    if (!token.empty() && !_impl->journal.hasToken(token)) return false; // an earlier copy
-    return _impl->journal.hasSaveOf(_impl->options.program, mark["save"].integer());
+    return mark["identity"].string() == databaseIdentity() && (token.empty() || _impl->journal.hasToken(token));
+}
+
+bool CXRolvane::hasSavedSince(const Dictionary& mark) {
+    std::lock_guard lock(_impl->mutex);
+    return isOfHistory(mark) && _impl->journal.hasSaveOf(_impl->options.program, mark["save"].integer());
 }
 
 void CXRolvane::recoverShareCount(Preferences& preferences) {
     std::lock_guard lock(_impl->mutex);
     ShareCountBump(*this, preferences).recover();
+}
+
+void CXRolvane::keepFormerVersions() {
+    std::lock_guard lock(_impl->mutex);
+    _impl->formerVersions.begin();
+}
+
+std::shared_ptr<const Bytes> CXRolvane::formerVersion(const UniqueId& uid, Date at) {
+    std::lock_guard lock(_impl->mutex);
+    return _impl->formerVersions.of(uid, at);
 }
 
 // Two people's edits of one contact -------------------------------------------------------------------------------

@@ -1,0 +1,91 @@
+#include "server/mod_cardbook/ReportRequest.h"
+
+#include "contacts/vcard/VCardText.h"
+#include "server/mod_cardbook/Refused.h"
+#include "server/mod_cardbook/XmlText.h"
+#include "server/mod_davacl/XmlElements.h"
+
+#include <charconv>
+
+namespace rolvane::cardbook {
+namespace {
+
+using davacl::attributeOf;
+using davacl::child;
+using davacl::isDav;
+using davacl::textOf;
+
+[[noreturn]] void badRequest(const std::string& words) {
+    throw Refused(400, words);
+}
+
+AddressData addressDataOf(const apr_xml_doc* doc, const apr_xml_elem* element) {
+    AddressData data;
+    const std::string type = vcardLower(attributeOf(element, "content-type"));
+    const std::string version = attributeOf(element, "version");
+    if ((!type.empty() && type != "text/vcard") || (!version.empty() && version != "3.0" && version != "4.0"))
+        throw Refused(403, kCardSpace, "supported-address-data", "Cards are text/vcard of version 3.0 or 4.0.");
+    data.version = version == "4.0" ? VCardVersion::v4 : VCardVersion::v3;
+    for (const apr_xml_elem* e = element->first_child; e; e = e->next) {
+        if (!isCard(doc, e, "prop")) continue; // C:allprop says what is the rule anyway
+        const std::string name = vcardUpper(attributeOf(e, "name"));
+        if (name.empty()) badRequest("A C:prop of an address-data names no property.");
+        data.lines.push_back({name, attributeOf(e, "novalue") == "yes"});
+    }
+    return data;
+}
+
+void readProperties(const apr_xml_doc* doc, const apr_xml_elem* prop, ReportRequest& request) {
+    for (const apr_xml_elem* e = prop->first_child; e; e = e->next) {
+        if (isCard(doc, e, "address-data"))
+            request.data = addressDataOf(doc, e);
+        else
+            request.properties.push_back({davacl::spaceOf(doc, e), e->name});
+    }
+}
+
+std::optional<uint64_t> limitOf(const apr_xml_elem* number) {
+    if (!number) return std::nullopt;
+    const std::string text = textOf(number);
+    uint64_t value = 0;
+    const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), value);
+    if (error != std::errc() || end != text.data() + text.size() || value == 0)
+        badRequest("nresults is no number above 0.");
+    return value;
+}
+
+} // namespace
+
+ReportRequest parseReport(const apr_xml_doc* doc) {
+    ReportRequest request;
+    const apr_xml_elem* root = doc ? doc->root : nullptr;
+    if (isCard(doc, root, "addressbook-multiget")) request.kind = ReportRequest::Kind::multiget;
+    if (isCard(doc, root, "addressbook-query")) request.kind = ReportRequest::Kind::query;
+    if (isDav(root, "sync-collection")) request.kind = ReportRequest::Kind::sync;
+    if (request.kind == ReportRequest::Kind::other) return request;
+    if (const apr_xml_elem* prop = child(root, "prop")) readProperties(doc, prop, request);
+    request.allProperties = child(root, "allprop") != nullptr;
+    request.namesOnly = child(root, "propname") != nullptr;
+    switch (request.kind) {
+    case ReportRequest::Kind::multiget:
+        for (const apr_xml_elem* e = root->first_child; e; e = e->next)
+            if (isDav(e, "href")) request.hrefs.push_back(textOf(e));
+        if (request.hrefs.empty()) badRequest("An addressbook-multiget names one DAV:href at least.");
+        break;
+    case ReportRequest::Kind::query:
+        request.filter = parseFilter(doc, cardChild(doc, root, "filter"));
+        request.limit = limitOf(cardChild(doc, cardChild(doc, root, "limit"), "nresults"));
+        break;
+    default: {
+        const apr_xml_elem* token = child(root, "sync-token");
+        if (!token) badRequest("A sync-collection has a DAV:sync-token, which may be empty.");
+        if (textOf(child(root, "sync-level")) == "infinite")
+            throw Refused(403, kDavSpace, "sync-traversal-supported", "There is nothing below a book.");
+        request.token = textOf(token);
+        request.limit = limitOf(child(child(root, "limit"), "nresults"));
+    }
+    }
+    return request;
+}
+
+} // namespace rolvane::cardbook

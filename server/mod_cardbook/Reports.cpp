@@ -1,0 +1,201 @@
+#include "server/mod_cardbook/Reports.h"
+
+#include "server/mod_cardbook/Multistatus.h"
+#include "server/mod_cardbook/PartialCard.h"
+#include "server/mod_cardbook/Properties.h"
+#include "server/mod_cardbook/ReportRequest.h"
+#include "server/mod_cardbook/XmlText.h"
+
+#include <algorithm>
+
+namespace rolvane::cardbook {
+namespace {
+
+constexpr size_t kPage = 500;                     // members read at a time
+constexpr size_t kMostResponses = 1000000;        // of one answer
+constexpr size_t kQueriedBytes = size_t{1} << 30; // of cards that one query reads
+
+class Report {
+public:
+    Report(Resource resource, const ReportRequest& request, ap_filter_t* output)
+        : _resource(std::move(resource)), _library(*_resource.library), _request(request),
+          _answer(_resource.r, output) {}
+
+    void deliver() {
+        switch (_request.kind) {
+        case ReportRequest::Kind::multiget: multiget(); break;
+        case ReportRequest::Kind::query: query(); break;
+        default: sync();
+        }
+        _answer.finish();
+    }
+
+private:
+    const std::string& book() const { return _resource.book->id; }
+    std::string pathOfCard(const std::string& name) const { return _resource.path({Place::Kind::card, book(), name}); }
+    std::optional<VCardVersion> version() const {
+        return _request.data ? std::optional(_request.data->version) : std::nullopt;
+    }
+
+    // RFC 6352 section 8.7. Names are looked up page by page, so that the answer begins at once.
+    void multiget() {
+        std::vector<Member> page;
+        const auto flush = [&] {
+            send(page);
+            page.clear();
+        };
+        for (const std::string& href : _request.hrefs) {
+            const auto path = pathOfHref(href);
+            const auto place = path ? placeOf(_resource.base, *path) : std::nullopt;
+            const bool isHere = place && place->kind == Place::Kind::card && place->book == book();
+            auto member = isHere ? _library.memory().named(book(), place->name) : std::nullopt;
+            if (!member) {
+                flush();
+                _answer.add("<D:response><D:href>" + xmlText(href) + "</D:href>" + statusLine(HTTP_NOT_FOUND) +
+                            "</D:response>\n");
+                continue;
+            }
+            page.push_back(std::move(*member));
+            if (page.size() == kPage) flush();
+        }
+        flush();
+    }
+
+    void query() {
+        const SqliteSnapshot moment(_library.memory().sqlite());
+        const auto asked =
+            _request.filter.isEverything() ? version() : std::optional(version().value_or(VCardVersion::v3));
+        uint64_t left = std::min<uint64_t>(_request.limit.value_or(kMostResponses), kMostResponses);
+        size_t bytes = 0;
+        bool isCut = false;
+        forEachPage(0, false, [&](const std::vector<Member>& page) {
+            _library.forEachCard(page, asked, [&](const Member& member, const Card* card) {
+                if (!card || isCut || !_request.filter.meets(card->text)) return;
+                if (left == 0 || (bytes += card->text.size()) > kQueriedBytes) {
+                    isCut = true;
+                    return;
+                }
+                --left;
+                sendCard(member, *card);
+            });
+            return !isCut;
+        });
+        if (isCut)
+            _answer.addStatus(_resource.path(), HTTP_INSUFFICIENT_STORAGE, "<D:number-of-matches-within-limits/>");
+    }
+
+    void sync() {
+        BookMemory& memory = _library.memory();
+        const SqliteSnapshot moment(memory.sqlite());
+        const bool isFirst = _request.token.empty();
+        const int64_t from = isFirst ? 0 : numberOfToken(_library, book(), _request.token);
+        int64_t until = memory.latest(book());
+        uint64_t left = std::min<uint64_t>(_request.limit.value_or(kMostResponses), kMostResponses);
+        bool isCut = false;
+        forEachPage(from, !isFirst, [&](std::vector<Member>& page) {
+            if (page.size() > left) {
+                page.resize(left);
+                isCut = true;
+            }
+            left -= page.size();
+            if (isCut && !page.empty()) until = page.back().sequence;
+            if (isCut && page.empty() && _lastSent) until = *_lastSent;
+            if (!page.empty()) _lastSent = page.back().sequence;
+            send(page);
+            return !isCut;
+        });
+        if (isCut)
+            _answer.addStatus(_resource.path(), HTTP_INSUFFICIENT_STORAGE, "<D:number-of-matches-within-limits/>");
+        _answer.add("<D:sync-token>" + syncToken(_library, until) + "</D:sync-token>\n");
+    }
+
+    template <class Call>
+    void forEachPage(int64_t from, bool withGone, Call call) {
+        for (;;) {
+            std::vector<Member> page = _library.memory().after(book(), from, withGone, kPage);
+            if (page.empty()) return;
+            from = page.back().sequence;
+            const bool isLast = page.size() < kPage;
+            if (!call(page) || isLast) return;
+        }
+    }
+
+    // Those that have left get a 404 (RFC 6578 section 3.5.2).
+    void send(const std::vector<Member>& page) {
+        std::vector<Member> run;
+        const auto flush = [&] {
+            _library.forEachCard(run, version(), [&](const Member& member, const Card* card) {
+                if (card)
+                    sendCard(member, *card);
+                else
+                    _answer.addStatus(pathOfCard(member.name), HTTP_NOT_FOUND);
+            });
+            run.clear();
+        };
+        for (const Member& member : page) {
+            if (!member.gone) {
+                run.push_back(member);
+                continue;
+            }
+            flush();
+            _answer.addStatus(pathOfCard(member.name), HTTP_NOT_FOUND);
+        }
+        flush();
+    }
+
+    void sendCard(const Member& member, const Card& card) {
+        _resource.place = {Place::Kind::card, book(), member.name};
+        _resource.member = member;
+        _resource.card = card;
+        std::string found, missing;
+        if (_request.namesOnly || _request.allProperties)
+            for (const PropertyName& name : propertiesOf(_resource))
+                found += _request.namesOnly ? emptyElement(name) : propertyElement(_resource, name).value_or("");
+        for (const PropertyName& name : _request.properties) {
+            if (auto element = propertyElement(_resource, name))
+                found += *element;
+            else
+                missing += emptyElement(name);
+        }
+        if (_request.data) {
+            found += "<C:address-data>";
+            appendXml(found, _request.data->lines.empty() ? card.text : partialCard(card.text, _request.data->lines));
+            found += "</C:address-data>";
+        }
+        std::string response = "<D:response><D:href>";
+        appendXml(response, escapedPath(_resource.path()));
+        response += "</D:href>";
+        if (!found.empty() || missing.empty())
+            response += "<D:propstat><D:prop>" + found + "</D:prop>" + statusLine(HTTP_OK) + "</D:propstat>";
+        if (!missing.empty())
+            response += "<D:propstat><D:prop>" + missing + "</D:prop>" + statusLine(HTTP_NOT_FOUND) + "</D:propstat>";
+        _answer.add(response + "</D:response>\n");
+        _resource.place = {Place::Kind::book, book(), {}};
+        _resource.member.reset();
+        _resource.card.reset();
+    }
+
+    Resource _resource;
+    Library& _library;
+    const ReportRequest& _request;
+    Multistatus _answer;
+    std::optional<int64_t> _lastSent;
+};
+
+} // namespace
+
+int deliverReport(request_rec* r, const dav_resource* resource, const apr_xml_doc* doc, ap_filter_t* output,
+                  dav_error** error) noexcept {
+    if (!isOurs(resource)) return DECLINED;
+    *error = contained(r, [&] {
+        const ReportRequest request = parseReport(doc);
+        const Resource& it = of(resource);
+        if (request.kind == ReportRequest::Kind::other || it.place.kind != Place::Kind::book || !it.book)
+            throw Refused(HTTP_FORBIDDEN, kDavSpace, "supported-report", "There is no such report here.");
+        Report(it, request, output).deliver();
+    });
+    if (*error && r->status == HTTP_MULTI_STATUS) *error = nullptr; // the answer had begun, and was broken off
+    return OK;
+}
+
+} // namespace rolvane::cardbook
