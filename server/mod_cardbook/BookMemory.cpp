@@ -29,7 +29,7 @@ CREATE INDEX members_gone ON members(seq) WHERE gone;
 CREATE TABLE wishes(book INTEGER NOT NULL, uid TEXT NOT NULL, name TEXT NOT NULL, PRIMARY KEY(book, uid)) WITHOUT ROWID;
 CREATE TABLE written(uid TEXT NOT NULL, digest BLOB NOT NULL, version INTEGER NOT NULL, text BLOB NOT NULL,
   PRIMARY KEY(uid, digest));
-CREATE TABLE looks(device TEXT NOT NULL, book TEXT NOT NULL, date REAL NOT NULL, PRIMARY KEY(device, book)) WITHOUT ROWID;
+CREATE TABLE looks(device TEXT NOT NULL, book TEXT NOT NULL, seq INTEGER NOT NULL, date REAL NOT NULL, PRIMARY KEY(device, book)) WITHOUT ROWID;
 CREATE TABLE had(device TEXT NOT NULL, uid TEXT NOT NULL, date REAL NOT NULL, PRIMARY KEY(device, uid)) WITHOUT ROWID;
 CREATE TABLE knows(device TEXT NOT NULL, property TEXT NOT NULL, PRIMARY KEY(device, property)) WITHOUT ROWID;
 )";
@@ -255,8 +255,14 @@ void BookMemory::wish(std::string_view book, const UniqueId& uid, std::string_vi
     s.bind(1, numberOf(book, true)).bind(2, uid.str()).bind(3, name).run();
 }
 
-void BookMemory::dropWishes() {
-    _sqlite.execute("DELETE FROM wishes");
+// Its former name leaves under an identifier that no record has.
+void BookMemory::rename(std::string_view book, const Member& member, std::string_view name) {
+    const int64_t number = numberOf(book, false);
+    noteGone(book, member.uid);
+    auto s = _sqlite.statement("UPDATE members SET uid=?3 WHERE book=?1 AND uid=?2");
+    s.bind(1, number).bind(2, member.uid.str()).bind(3, "former:" + std::to_string(_sequence)).run();
+    wish(book, member.uid, name);
+    note(book, member.uid, member.modified);
 }
 
 void BookMemory::forgetOldDepartures() {

@@ -77,7 +77,7 @@ public:
     void noteBookGone(std::string_view book);
     // What the next `note` of the card in that book calls it.
     void wish(std::string_view book, const UniqueId& uid, std::string_view name);
-    void dropWishes();
+    void rename(std::string_view book, const Member& member, std::string_view name); // to one that is free
     void forgetOldDepartures();
     // A comparison of everything: between the two, every card that is there is noted; the others are then gone.
     void beginComparison();

@@ -6,6 +6,7 @@
 #include "server/mod_cardbook/Reports.h"
 #include "server/mod_cardbook/Repository.h"
 #include "server/mod_cardbook/Resource.h"
+#include "server/mod_cardbook/Writing.h"
 
 namespace rolvane::cardbook {
 namespace {
@@ -36,6 +37,7 @@ void registerHooks(apr_pool_t* pool) noexcept {
     dav_register_liveprop_group(pool, &kLiveProperties);
     dav_hook_find_liveprop(findLiveProperty, nullptr, nullptr, APR_HOOK_FIRST);
     dav_hook_insert_all_liveprops(insertAllLiveProperties, nullptr, nullptr, APR_HOOK_MIDDLE);
+    dav_hook_method_precondition(prepareMethod, nullptr, nullptr, APR_HOOK_MIDDLE);
     dav_hook_deliver_report(deliverReport, nullptr, nullptr, APR_HOOK_MIDDLE);
     // No gather_reports: httpd 2.4.71 makes the array for pointers but reads larger structures out of it, and a
     // provider with more than one report ends the worker. DAV:supported-report-set is a live property here.

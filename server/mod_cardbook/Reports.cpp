@@ -1,5 +1,6 @@
 #include "server/mod_cardbook/Reports.h"
 
+#include "server/mod_cardbook/Devices.h"
 #include "server/mod_cardbook/Multistatus.h"
 #include "server/mod_cardbook/PartialCard.h"
 #include "server/mod_cardbook/Properties.h"
@@ -85,11 +86,20 @@ private:
     }
 
     void sync() {
+        int64_t until = 0;
+        {
+            const SqliteSnapshot moment(_library.memory().sqlite());
+            syncAtOnce(until);
+        }
+        Devices(_library.memory())
+            .noteLook(_resource.r->user, book(), until, Date(static_cast<double>(_resource.r->request_time) / 1e6));
+    }
+
+    void syncAtOnce(int64_t& until) {
         BookMemory& memory = _library.memory();
-        const SqliteSnapshot moment(memory.sqlite());
         const bool isFirst = _request.token.empty();
         const int64_t from = isFirst ? 0 : numberOfToken(_library, book(), _request.token);
-        int64_t until = memory.latest(book());
+        until = memory.latest(book());
         uint64_t left = std::min<uint64_t>(_request.limit.value_or(kMostResponses), kMostResponses);
         bool isCut = false;
         forEachPage(from, !isFirst, [&](std::vector<Member>& page) {
@@ -125,10 +135,9 @@ private:
         std::vector<Member> run;
         const auto flush = [&] {
             _library.forEachCard(run, version(), [&](const Member& member, const Card* card) {
-                if (card)
-                    sendCard(member, *card);
-                else
-                    _answer.addStatus(pathOfCard(member.name), HTTP_NOT_FOUND);
+                if (!card) return _answer.addStatus(pathOfCard(member.name), HTTP_NOT_FOUND);
+                sendCard(member, *card);
+                if (_request.data) noteHad(member, *card);
             });
             run.clear();
         };
@@ -141,6 +150,14 @@ private:
             _answer.addStatus(pathOfCard(member.name), HTTP_NOT_FOUND);
         }
         flush();
+    }
+
+    // Of a multiget: in the other reports the look at the book says it.
+    void noteHad(const Member& member, const Card& card) {
+        if (_request.kind != ReportRequest::Kind::multiget) return;
+        if (!_lookedAt) _lookedAt = Devices(_library.memory()).lookedAt(_resource.r->user, book());
+        if (member.sequence > *_lookedAt)
+            Devices(_library.memory()).noteHad(_resource.r->user, member.uid, card.modified);
     }
 
     void sendCard(const Member& member, const Card& card) {
@@ -179,7 +196,7 @@ private:
     Library& _library;
     const ReportRequest& _request;
     Multistatus _answer;
-    std::optional<int64_t> _lastSent;
+    std::optional<int64_t> _lastSent, _lookedAt;
 };
 
 } // namespace

@@ -1,5 +1,6 @@
 #include "server/mod_cardbook/Repository.h"
 
+#include "server/mod_cardbook/Devices.h"
 #include "server/mod_cardbook/Resource.h"
 #include "server/mod_cardbook/Writing.h"
 
@@ -88,6 +89,9 @@ dav_error* setHeaders(request_rec* r, const dav_resource* resource) noexcept {
         if (!it.member) return;
         it.card = it.library->card(*it.member, acceptedVersion(r));
         if (!it.card) throw Refused(HTTP_NOT_FOUND, "The card has just gone.");
+        Devices devices(it.library->memory());
+        if (!devices.isCoveredByLook(r->user, it.place.book, *it.member))
+            devices.noteHad(r->user, it.member->uid, it.card->modified);
         apr_table_set(r->headers_out, "ETag", it.card->tag.c_str());
         apr_table_setn(r->headers_out, "Vary", "Accept");
         ap_update_mtime(r, apr_time_from_sec(static_cast<apr_time_t>(it.card->modified.secondsSince1970())));
@@ -148,6 +152,9 @@ private:
 
     dav_error* visitMembers(const Resource& book) {
         constexpr size_t kPage = 500;
+        BookMemory& memory = book.library->memory();
+        Devices(memory).noteLook(book.r->user, book.place.book, memory.latest(book.place.book),
+                                 Date(static_cast<double>(book.r->request_time) / 1e6));
         const SqliteSnapshot moment(book.library->memory().sqlite());
         apr_pool_t* pool = nullptr;
         apr_pool_create(&pool, _parameters.pool);

@@ -26,11 +26,12 @@ Idle& idle() {
 struct Lent {
     std::string database;
     std::unique_ptr<Library> library;
+    bool hasFailed = false;
 };
 
 apr_status_t giveBack(void* data) noexcept {
     std::unique_ptr<Lent> lent(static_cast<Lent*>(data));
-    if (!lent->library) return APR_SUCCESS;
+    if (lent->hasFailed) return APR_SUCCESS;
     try {
         lent->library->rolvane().rollback();
         std::lock_guard lock(idle().mutex);
@@ -84,25 +85,19 @@ Library& libraryOf(request_rec* r) {
     if (!r->user)
         throw Refused(HTTP_INTERNAL_SERVER_ERROR,
                       "Nobody is signed in: the books are served behind \"Require valid-user\" only.");
-    Lent* lent = lentTo(r);
-    if (lent && lent->library) return *lent->library;
+    if (Lent* lent = lentTo(r)) return *lent->library;
     auto fresh = std::make_unique<Lent>();
     fresh->database = c.database;
     fresh->library = take(fresh->database);
     fresh->library->catchUp();
-    if (lent) {
-        lent->library = std::move(fresh->library);
-        return *lent->library;
-    }
-    lent = fresh.release();
+    Lent* lent = fresh.release();
     apr_pool_userdata_setn(lent, kLibraryKey, nullptr, mainOf(r)->pool);
-    // Before the pools of what was made with it: those belong to this one, and are cleaned first.
     apr_pool_cleanup_register(mainOf(r)->pool, lent, giveBack, apr_pool_cleanup_null);
     return *lent->library;
 }
 
 void dropLibrary(request_rec* r) {
-    if (Lent* lent = lentTo(r)) lent->library.reset();
+    if (Lent* lent = lentTo(r)) lent->hasFailed = true;
 }
 
 dav_resource* newResource(apr_pool_t* pool, Resource resource) {

@@ -17,6 +17,7 @@ struct Resource {
     std::shared_ptr<const Book> book; // of a book and a card; null: there is none
     std::optional<Member> member;     // of a card; nothing: there is none
     std::optional<Card> card;         // once its text was asked for
+    bool isReplaced = false;          // the destination of a COPY or MOVE, which sees to it itself
 
     bool exists() const;
     std::string path() const { return pathOf(base, place); }
@@ -26,7 +27,7 @@ struct Resource {
 // The library of a request, its sub-requests' too: caught up, and given back for others when the request ends. Throws
 // Refused where none is configured or nobody is signed in.
 Library& libraryOf(request_rec* r);
-// What has failed in it is not to be used again.
+// Something has failed in it: nobody gets it after this request.
 void dropLibrary(request_rec* r);
 
 // mod_dav's form of it, in the pool; its paths are whole ones.

@@ -1,0 +1,355 @@
+#include "server/mod_cardbook/CardWriter.h"
+
+#include "contacts/vcard/VCardFields.h"
+#include "contacts/vcard/VCardText.h"
+#include "foundation/PropertyList.h"
+#include "server/mod_cardbook/CardMerge.h"
+#include "server/mod_cardbook/CardText.h"
+#include "server/mod_cardbook/Devices.h"
+#include "server/mod_cardbook/Refused.h"
+#include "server/mod_cardbook/XmlText.h"
+
+#include <cerrno>
+#include <fcntl.h>
+#include <sys/file.h>
+#include <unistd.h>
+
+namespace rolvane::cardbook {
+namespace {
+
+Refused changedMeanwhile() {
+    return {412, "The card has changed meanwhile."};
+}
+
+Refused notHere(const std::string& words) {
+    return {403, kCardSpace, "addressbook-collection-location-ok", words};
+}
+
+bool isGroupRecord(const UniqueId& uid) {
+    return cxTableName(uid).ends_with("Group");
+}
+
+} // namespace
+
+// Writers take turns, so that a name or a UID that one of them has found free still is when it saves.
+class CardWriter::Turn {
+public:
+    explicit Turn(const std::string& path) : _file(::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600)) {
+        int locked = -1;
+        while (_file >= 0 && (locked = ::flock(_file, LOCK_EX)) != 0 && errno == EINTR) continue;
+        if (locked != 0) throw CXException(kCXDatabaseException, "Could not lock " + path + ".");
+    }
+    ~Turn() {
+        if (_file >= 0) ::close(_file);
+    }
+    Turn(const Turn&) = delete;
+    Turn& operator=(const Turn&) = delete;
+
+private:
+    int _file;
+};
+
+CardWriter::CardWriter(Library& library, WriteContext context)
+    : _library(library), _rolvane(library.rolvane()), _memory(library.memory()), _c(std::move(context)) {}
+
+// The card of the name now. It must be what the conditions were judged against.
+std::optional<Member> CardWriter::settle() {
+    _library.catchUp();
+    const auto now = _memory.named(_c.book.id, _c.name);
+    if (_c.isConditional) {
+        const bool isSame = now && _c.judged && now->uid == _c.judged->uid && now->modified == _c.judged->modified;
+        if (!isSame && (now || _c.judged)) throw changedMeanwhile();
+    }
+    return now;
+}
+
+void CardWriter::requireWritable(const Book& book) const {
+    if (book.isWritable) return;
+    const std::string path = escapedPath(pathOf(_c.base, {Place::Kind::book, book.id, {}}));
+    throw Refused(403, kDavSpace, "need-privileges", "Whoever shares these contacts does not let you write.",
+                  "<D:resource><D:href>" + xmlText(path) +
+                      "</D:href><D:privilege><D:write/></D:privilege></D:resource>");
+}
+
+void CardWriter::wish(const Book& book, const UniqueId& uid, const std::string& name) {
+    BookMemory::Change change(_memory);
+    _memory.wish(book.id, uid, name);
+    change.commit();
+}
+
+void CardWriter::save(const std::vector<CXExpected>& expected) {
+    try {
+        if (!_rolvane.saveIfStill(expected)) throw changedMeanwhile();
+    } catch (const std::exception&) {
+        _rolvane.rollback();
+        throw;
+    }
+    _library.catchUp();
+}
+
+// Finding ----------------------------------------------------------------------------------------------------------
+
+// References to a UUID may be spelt in the other letter case than the record.
+CXRecordRef CardWriter::recordOf(const std::string& uid, std::string_view table) {
+    const std::string uuid = vcardUUIDForUID(uid);
+    for (const std::string& spelling : {uuid, vcardUpper(uuid), vcardLower(uuid)})
+        if (auto record = _rolvane.recordForUniqueId(UniqueId(spelling + ":" + std::string(table)))) return record;
+    return nullptr;
+}
+
+void CardWriter::conflict(const Member& other) {
+    const std::string path = escapedPath(pathOf(_c.base, {Place::Kind::card, _c.book.id, other.name}));
+    throw Refused(409, kCardSpace, "no-uid-conflict", "Another card has this UID, or this card has another one.",
+                  "<D:href>" + xmlText(path) + "</D:href>");
+}
+
+// The record that the card is about; null for a new one.
+CXRecordRef CardWriter::target(const ClientCard& card, const std::optional<Member>& now) {
+    const bool isShared = _c.book.kind == Book::Kind::shared;
+    const CXRecordRef person = recordOf(card.entity.uid, isShared ? kCXSubscribedPersonTable : kCXPersonTable);
+    const CXRecordRef group = recordOf(card.entity.uid, isShared ? kCXSubscribedGroupTable : kCXGroupTable);
+    const CXRecordRef found = person ? person : group;
+    if (now && (!found || found->uniqueId() != now->uid)) conflict(*now);
+    if (!found) return nullptr;
+    if (const auto here = now ? std::nullopt : _memory.of(_c.book.id, found->uniqueId())) conflict(*here);
+    if ((found == group) != card.entity.isGroup) conflict(now ? *now : Member{found->uniqueId(), _c.name, {}});
+    if (isShared && !now) conflict({found->uniqueId(), _c.name, {}}); // in another of the shared books
+    return found;
+}
+
+CXGroupRef CardWriter::groupOf(const Book& book) {
+    auto group = std::dynamic_pointer_cast<CXGroup>(_rolvane.recordForUniqueId(book.group));
+    if (!group) throw Refused(404, "The group has gone.");
+    return group;
+}
+
+// Writing ----------------------------------------------------------------------------------------------------------
+
+Written CardWriter::put(const std::string& text) {
+    requireWritable(_c.book);
+    const ClientCard card = readClientCard(text);
+    if (!isUsableName(_c.name)) throw notHere("A card cannot be called so.");
+    if (card.entity.isGroup && _c.book.kind != Book::Kind::contacts)
+        throw notHere("Cards of groups are written in \"Contacts\".");
+    const Turn turn(bookMemoryPath(_rolvane.path()) + ".lock");
+    const auto now = settle();
+    Written written = card.entity.isGroup ? putGroup(card, now) : putPerson(card, now);
+    Devices(_memory).noteKnowledge(_c.device, knowledgeOf(card));
+    return written;
+}
+
+// The version that the client wrote over, as far as it is known.
+std::optional<Dictionary> CardWriter::hadBy(const std::optional<Member>& now, const Dictionary& properties) {
+    if (!now) return std::nullopt; // by another name, or in another book: nothing is known to be common
+    if (_c.isConditional) return properties;
+    const Devices::Had had = Devices(_memory).had(_c.device, _c.book.id, *now);
+    if (had.isPresent) return properties;
+    const auto former = had.then ? _rolvane.formerVersion(now->uid, *had.then) : nullptr;
+    if (!former) return std::nullopt;
+    return BinaryValue::decode(*former).dictionary();
+}
+
+void CardWriter::apply(const CXPersonRef& person, const Dictionary& before, const Dictionary& after) {
+    for (const auto& [name, value] : after)
+        if (before[name] != value) person->setValue(value, name);
+    for (const auto& [name, value] : before)
+        if (!after.contains(name)) person->removeValueForProperty(name);
+}
+
+Written CardWriter::putPerson(const ClientCard& card, const std::optional<Member>& now) {
+    auto person = std::dynamic_pointer_cast<CXPerson>(target(card, now));
+    const bool isShared = _c.book.kind == Book::Kind::shared;
+    std::vector<CXExpected> expected;
+    if (person) {
+        const Dictionary before = person->dictionaryRepresentation();
+        expected.push_back({person->uniqueId(), person->valueForProperty(kCXModificationDateProperty).date()});
+        Devices devices(_memory);
+        const auto merge = mergedCard(person->uniqueId(), hadBy(now, before), before, card,
+                                      [&](const std::string& property) { return devices.knows(_c.device, property); });
+        apply(person, before, merge.contact);
+        if (!merge.conflicts.empty()) _rolvane.noteConflicts(person->uniqueId(), merge.conflicts);
+    } else {
+        const std::string table(isShared ? kCXSubscribedPersonTable : kCXPersonTable);
+        person = CXPerson::initWithUniqueId(UniqueId(vcardUUIDForUID(card.entity.uid) + ":" + table));
+        person->resetWithDictionary(card.entity.properties, true, false);
+        if (isShared) {
+            CXMutableMultiValue where;
+            where.addValue(_c.book.location.str(), kCXSubscribeLabel);
+            person->setValue(where, kCXRemoteLocationProperty);
+        }
+        _rolvane.addRecord(person);
+        expected.push_back({person->uniqueId(), std::nullopt});
+    }
+    if (_c.book.kind == Book::Kind::group) groupOf(_c.book)->addMember(person);
+    const UniqueId uid = person->uniqueId();
+    const auto encoded = person->encodedRepresentation();
+    const bool isWhole = saysTheSame(uid, BinaryValue::decode(*encoded).dictionary(), card);
+    const Bytes digest = Library::digestOf(*encoded);
+    {
+        BookMemory::Change change(_memory);
+        if (!now) _memory.wish(_c.book.id, uid, _c.name);
+        if (!now && !isShared && !_memory.of(kContactsBook, uid)) _memory.wish(kContactsBook, uid, _c.name);
+        if (isWhole) _memory.setWritten(uid, digest, {card.text, card.isVersion4});
+        change.commit();
+    }
+    save(expected);
+    const auto member = _memory.of(_c.book.id, uid);
+    if (!member) throw Refused(409, "The card has left the book at the same moment.");
+    {
+        BookMemory::Change change(_memory);
+        _memory.keepWrittenOnly(uid, digest);
+        change.commit();
+    }
+    Devices(_memory).noteHad(_c.device, uid, member->modified);
+    return {isWhole ? Library::tagOf(uid, member->modified) : "", !now};
+}
+
+Written CardWriter::putGroup(const ClientCard& card, const std::optional<Member>& now) {
+    auto group = std::dynamic_pointer_cast<CXGroup>(target(card, now));
+    std::vector<CXExpected> expected;
+    VCardEntity before;
+    bool mayRemove = _c.isConditional;
+    if (group) {
+        before = groupEntity(_rolvane, *group);
+        expected.push_back({group->uniqueId(), group->valueForProperty(kCXModificationDateProperty).date()});
+        mayRemove = mayRemove || Devices(_memory).had(_c.device, _c.book.id, *now).isPresent;
+    } else {
+        group =
+            CXGroup::initWithUniqueId(UniqueId(vcardUUIDForUID(card.entity.uid) + ":" + std::string(kCXGroupTable)));
+        group->resetWithDictionary(card.entity.properties, true, false);
+        _rolvane.addRecord(group);
+        expected.push_back({group->uniqueId(), std::nullopt});
+    }
+    for (const auto& [name, value] : card.entity.properties)
+        if (group->valueForProperty(name) != value) group->setValue(value, name);
+    setMembers(group, card, before, mayRemove);
+    const UniqueId uid = group->uniqueId();
+    const VCardEntity after = groupEntity(_rolvane, *group);
+    const bool isWhole = card.isWhole && after.members == card.entity.members &&
+                         after.subgroups == card.entity.subgroups && after.properties == card.entity.properties;
+    const Bytes digest = Library::digestOf(groupDigestText(after));
+    {
+        BookMemory::Change change(_memory);
+        if (!now) _memory.wish(_c.book.id, uid, _c.name);
+        if (isWhole) _memory.setWritten(uid, digest, {card.text, card.isVersion4});
+        change.commit();
+    }
+    save(expected);
+    const auto member = _memory.of(_c.book.id, uid);
+    if (!member) throw Refused(409, "The group has left the book at the same moment.");
+    Devices(_memory).noteHad(_c.device, uid, member->modified);
+    return {isWhole ? Library::tagOf(uid, member->modified) : "", !now};
+}
+
+// Members who have no card here are kept by their UIDs, as the import does. A client that never wrote a member does not
+// know of members.
+bool CardWriter::setMembers(const CXGroupRef& group, const ClientCard& card, const VCardEntity& before,
+                            bool mayRemove) {
+    std::set<std::string> said;
+    Dictionary properties = group->dictionaryRepresentation();
+    std::vector<VCardLine> missing;
+    if (!mayRemove) missing = vcardKeptLines(properties, kVCardMissingMemberLine);
+    for (const auto* list : {&card.entity.members, &card.entity.subgroups})
+        for (const std::string& uid : *list) {
+            said.insert(vcardMemberKey(uid));
+            if (auto person = std::dynamic_pointer_cast<CXPerson>(recordOf(uid, kCXPersonTable))) {
+                group->addMember(person);
+            } else if (auto subgroup = std::dynamic_pointer_cast<CXGroup>(recordOf(uid, kCXGroupTable))) {
+                if (group->mayListSubgroup(subgroup)) group->addSubgroup(subgroup);
+            } else {
+                VCardLine line;
+                line.name = kVCardMissingMemberLine;
+                line.value = vcardEscape(uid);
+                if (std::find(missing.begin(), missing.end(), line) == missing.end()) missing.push_back(line);
+            }
+        }
+    const bool knowsMembers = !said.empty() || Devices(_memory).knows(_c.device, "line:MEMBER");
+    if (!mayRemove || !knowsMembers) return false;
+    vcardReplaceKeptLines(properties, kVCardMissingMemberLine, missing);
+    const Value& extras = properties[kCXVCardExtraProperty];
+    if (group->valueForProperty(kCXVCardExtraProperty) != extras) group->setValue(extras, kCXVCardExtraProperty);
+    for (const std::string& uid : before.members)
+        if (!said.contains(vcardMemberKey(uid)))
+            if (auto person = std::dynamic_pointer_cast<CXPerson>(recordOf(uid, kCXPersonTable)))
+                group->removeMember(person);
+    for (const std::string& uid : before.subgroups)
+        if (!said.contains(vcardMemberKey(uid)))
+            if (auto subgroup = std::dynamic_pointer_cast<CXGroup>(recordOf(uid, kCXGroupTable)))
+                group->removeSubgroup(subgroup);
+    return true;
+}
+
+// Removing and moving ----------------------------------------------------------------------------------------------
+
+void CardWriter::remove() {
+    requireWritable(_c.book);
+    const Turn turn(bookMemoryPath(_rolvane.path()) + ".lock");
+    const auto now = settle();
+    if (!now) throw Refused(404, "The card has gone already.");
+    if (_c.book.kind == Book::Kind::shared && isGroupRecord(now->uid))
+        throw notHere("Groups of other people stay theirs.");
+    const CXRecordRef record = _rolvane.recordForUniqueId(now->uid);
+    if (!record) throw Refused(404, "The card has gone already.");
+    if (_c.book.kind == Book::Kind::group)
+        groupOf(_c.book)->removeMember(std::dynamic_pointer_cast<CXPerson>(record));
+    else
+        _rolvane.removeRecord(record);
+    save(_c.isConditional ? std::vector<CXExpected>{{now->uid, now->modified}} : std::vector<CXExpected>{});
+}
+
+// The record of the card joins the book of a group.
+bool CardWriter::join(const Book& to, const std::string& name, bool mayReplace) {
+    const auto now = settle();
+    if (!now) throw Refused(404, "The card has gone already.");
+    const auto person = std::dynamic_pointer_cast<CXPerson>(_rolvane.recordForUniqueId(now->uid));
+    if (!person || person->isSubscribed()) throw notHere("Only people of your own can be in your groups.");
+    const auto there = _memory.named(to.id, name);
+    if (there && (!mayReplace || there->uid != now->uid)) throw changedMeanwhile();
+    const auto here = _memory.of(to.id, now->uid);
+    if (here && here->name != name) conflict(*here);
+    if (!here) wish(to, now->uid, name);
+    groupOf(to)->addMember(person);
+    return !there;
+}
+
+bool CardWriter::copy(const Book& to, const std::string& name, bool mayReplace) {
+    if (_c.book.kind == Book::Kind::shared || to.kind != Book::Kind::group || to.id == _c.book.id)
+        throw notHere("A card has one UID, so it is copied from \"Contacts\" or a group into another group only.");
+    if (!isUsableName(name)) throw notHere("A card cannot be called so.");
+    const Turn turn(bookMemoryPath(_rolvane.path()) + ".lock");
+    const bool made = join(to, name, mayReplace);
+    save({});
+    return made;
+}
+
+bool CardWriter::move(const Book& to, const std::string& name, bool mayReplace) {
+    requireWritable(_c.book);
+    if (!isUsableName(name)) throw notHere("A card cannot be called so.");
+    const Turn turn(bookMemoryPath(_rolvane.path()) + ".lock");
+    if (to.id == _c.book.id) {
+        const auto now = settle();
+        if (!now) throw Refused(404, "The card has gone already.");
+        if (_memory.named(to.id, name)) throw notHere("Another card is called so.");
+        BookMemory::Change change(_memory);
+        _memory.rename(to.id, *now, name);
+        change.commit();
+        return true;
+    }
+    if (_c.book.kind != Book::Kind::group || to.kind == Book::Kind::shared)
+        throw notHere("Cards move from group to group, or out of a group to \"Contacts\", where they are.");
+    bool made = false;
+    if (to.kind == Book::Kind::group) {
+        made = join(to, name, mayReplace);
+    } else {
+        const auto now = settle();
+        const auto there = now ? _memory.of(to.id, now->uid) : std::nullopt;
+        if (!there || there->name != name) throw notHere("In \"Contacts\" the card has its name already.");
+        if (!mayReplace) throw changedMeanwhile();
+    }
+    const auto now = _memory.named(_c.book.id, _c.name);
+    if (now) groupOf(_c.book)->removeMember(std::dynamic_pointer_cast<CXPerson>(_rolvane.recordForUniqueId(now->uid)));
+    save({});
+    return made;
+}
+
+} // namespace rolvane::cardbook

@@ -1,0 +1,38 @@
+#pragma once
+
+#include "server/mod_cardbook/BookMemory.h"
+
+#include <set>
+
+namespace rolvane::cardbook {
+
+// What each device is known to have and to understand, in the books' memory. A device is who is signed in. One thread
+// at a time; each writing operation is durable on return.
+class Devices {
+public:
+    explicit Devices(BookMemory& memory) : _sqlite(memory.sqlite()) {}
+
+    // The device was told of all that a book held at that number and moment.
+    void noteLook(const std::string& device, const std::string& book, int64_t sequence, Date when);
+    // The device has had the card of that state, whatever it was told of its book.
+    void noteHad(const std::string& device, const UniqueId& uid, Date modified);
+    void noteKnowledge(const std::string& device, const std::set<std::string>& properties);
+
+    bool knows(const std::string& device, const std::string& property);
+
+    // Which state of a card the device had.
+    struct Had {
+        bool isPresent = false;   // the present one
+        std::optional<Date> then; // one of that moment; nothing: not known
+    };
+    Had had(const std::string& device, const std::string& book, const Member& now);
+    int64_t lookedAt(const std::string& device, const std::string& book); // the number of the latest look, else -1
+    bool isCoveredByLook(const std::string& device, const std::string& book, const Member& member) {
+        return lookedAt(device, book) >= member.sequence;
+    }
+
+private:
+    Sqlite& _sqlite;
+};
+
+} // namespace rolvane::cardbook
