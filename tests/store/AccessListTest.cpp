@@ -338,6 +338,36 @@ TEST_F(StoreLists, TheOrderOfEntriesStaysBecauseTheFirstThatDecidesCounts) {
     EXPECT_EQ(order(), "staff carl D:all");
 }
 
+TEST_F(StoreLists, AGrantBehindADenialThatTakesItIsNone) {
+    const auto deny = [](const std::string& whom, const std::string& what) {
+        return "<D:ace><D:principal>" + whom + "</D:principal><D:deny>" + privilege(what) + "</D:deny></D:ace>";
+    };
+    const std::string bob = AclStore::ace("/principals/bob", {"read", "write"});
+    const std::string toBob = "<D:href>/principals/bob</D:href>", toCarl = "<D:href>/principals/carl</D:href>";
+    const auto readAs = [&](const Names& entries) {
+        store.entries = entries;
+        return read();
+    };
+    EXPECT_EQ(readAs({deny("<D:all/>", "read"), bob}), "r; w bob");
+    EXPECT_EQ(readAs({deny("<D:authenticated/>", "all"), bob}), "r; w");
+    EXPECT_EQ(readAs({deny("<D:all/>", "bind"), bob}), "r bob; w");
+    EXPECT_EQ(readAs({deny(toBob, "write"), bob}), "r bob; w");
+    EXPECT_EQ(readAs({deny(toCarl, "all"), bob}), "r bob; w bob");
+    EXPECT_EQ(readAs({deny("<D:unauthenticated/>", "all"), bob}), "r bob; w bob");
+    EXPECT_EQ(readAs({bob, deny("<D:all/>", "all")}), "r bob; w bob");
+}
+
+TEST_F(StoreLists, AReaderWhoseGrantADenialTakesGetsOneInFrontOfIt) {
+    const std::string denyAll =
+        "<D:ace><D:principal><D:all/></D:principal><D:deny>" + privilege("read") + "</D:deny></D:ace>";
+    store.entries = {denyAll, AclStore::ace("/principals/bob", {"read"}), AclStore::ace("/principals/carl", {"read"})};
+    EXPECT_EQ(read(), "r; w");
+    EXPECT_TRUE(set({"bob"}, {}));
+    ASSERT_EQ(store.entries.size(), 2u) << "a grant that gives nothing to nobody's wish is gone";
+    EXPECT_NE(store.entries[0].find("/principals/bob"), std::string::npos);
+    EXPECT_EQ(store.lists(), "r bob; w");
+}
+
 TEST_F(StoreLists, TheServersOwnEntriesAreNotSentBack) {
     set({"bob"}, {});
     EXPECT_EQ(store.bodies.back().find("protected"), std::string::npos);

@@ -1,5 +1,6 @@
 #include "StoreWorld.h"
 #include "foundation/PropertyList.h"
+#include "store/dav/CXDAVNode.h"
 #include "store/locks/StoreLock.h"
 #include "support/CapturingLog.h"
 
@@ -91,6 +92,22 @@ TEST(HostileStore, ADictionaryThatIsNestedTooDeepToBeKeptIsNone) {
         EXPECT_NO_THROW(PropertyList::toXML(kept));
         EXPECT_NO_THROW(BinaryValue::encode(kept));
     }
+}
+
+TEST(HostileStore, WritesNothingToTheStandardErrorOfItsReader) {
+    const std::string bodies[] = {
+        "<?xml version=\"1.0\" encoding=\"no-such-thing\"?><D:x xmlns:D=\"DAV:\"/>",
+        "<?xml version=\"1.0\" encoding=\"utf-8\"?><D:x xmlns:D=\"DAV:\">\xff\xfe\xc3(</D:x>",
+        "<?xml version=\"1.0\" encoding=\"utf-16\"?><D:x xmlns:D=\"DAV:\">a</D:x>",
+        "<?xml version=\"1.0\" encoding=\"iso-2022-jp\"?><D:x xmlns:D=\"DAV:\">\x1b$B\xff</D:x>",
+        "<?xml version=\"1.0\" encoding=\"us-ascii\"?><D:x xmlns:D=\"DAV:\">\xe4</D:x>",
+        std::string("\xff\xfe<\0?\0x\0m\0l\0\xd8\xd8", 14),
+        "<!DOCTYPE x SYSTEM \"http://127.0.0.1:1/x\"><x>&y;</x>",
+        "<p:x/>",
+        "<x xmlns:a=\"not a uri %\" xmlns:a=\"b\" c=\"<\"/>"};
+    testing::internal::CaptureStderr();
+    for (const std::string& body : bodies) (void)parseDAVTree(body);
+    EXPECT_EQ(testing::internal::GetCapturedStderr(), "");
 }
 
 TEST(HostileStore, AServerOfAnotherClassIsNotAWebDAVServer) {

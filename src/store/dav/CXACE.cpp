@@ -73,6 +73,12 @@ bool CXACE::canWrite() const {
                        [this](std::string_view part) { return _privileges.contains(std::string(part)); });
 }
 
+bool CXACE::canWriteSomething() const {
+    return canWrite() || std::any_of(kWriteParts.begin(), kWriteParts.end(), [this](std::string_view part) {
+               return _privileges.contains(std::string(part));
+           });
+}
+
 bool CXACE::isPlain() const {
     return std::all_of(_privileges.begin(), _privileges.end(), [](const std::string& privilege) {
         return privilege == "read" || privilege == "write" || privilege == "all" ||

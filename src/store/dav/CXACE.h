@@ -39,6 +39,7 @@ public:
     // all the parts of DAV:write together are as good as DAV:write.
     bool canRead() const;
     bool canWrite() const;
+    bool canWriteSomething() const; // a part of writing at least
     // Nothing but what reading and writing consist of.
     bool isPlain() const;
 

@@ -58,10 +58,33 @@ std::string grantTo(const std::string& href, bool read, bool write) {
     return ace + "</D:grant></D:ace>";
 }
 
-bool deniesEverybody(const CXACE& ace) {
-    return !ace.isGrant() && (ace.isInverted() || ace.principal() == CXACE::Principal::all ||
-                              ace.principal() == CXACE::Principal::authenticated);
-}
+// What the denials of a list keep from a principal: a grant behind them gives nothing of it (RFC 3744 section 6).
+class Denials {
+public:
+    void add(const CXACE& ace) {
+        if (!concernsSomebody(ace)) return;
+        const std::string whom = concernsEverybody(ace) ? std::string() : ace.href();
+        _any.insert(whom);
+        if (ace.canRead()) _reading.insert(whom);
+        if (ace.canWriteSomething()) _writing.insert(whom);
+    }
+    bool ofReading(const std::string& href) const { return holds(_reading, href); }
+    bool ofWriting(const std::string& href) const { return holds(_writing, href); }
+    bool ofAnything(const std::string& href) const { return holds(_any, href); }
+
+private:
+    static bool concernsEverybody(const CXACE& ace) {
+        return ace.isInverted() || ace.principal() == CXACE::Principal::all ||
+               ace.principal() == CXACE::Principal::authenticated;
+    }
+    static bool concernsSomebody(const CXACE& ace) {
+        return !ace.isGrant() && (concernsEverybody(ace) || ace.principal() == CXACE::Principal::href);
+    }
+    static bool holds(const std::set<std::string>& from, const std::string& href) {
+        return from.contains(href) || from.contains(std::string());
+    }
+    std::set<std::string> _any, _reading, _writing; // hrefs; "" is everybody
+};
 
 // The precondition that the server names (RFC 3744 section 8.1.1), for the log.
 std::string reasonIn(const HttpResponse& answer) {
@@ -138,11 +161,13 @@ bool StoreAccessLists::isOurs(const OnStore& found, const CXACE& ace) const {
 
 AccessLists StoreAccessLists::listsOf(const OnStore& found) const {
     AccessLists lists;
+    Denials before;
     for (const CXACE& ace : found.inheritedFrom.empty() ? found.entries : found.inherited) {
+        before.add(ace);
         if (!isOurs(found, ace)) continue;
         const std::string name = found.principals->nameFor(ace.href());
-        if (ace.canRead()) addIfAbsent(lists.readers, name);
-        if (ace.canWrite()) addIfAbsent(lists.writers, name);
+        if (ace.canRead() && !before.ofReading(ace.href())) addIfAbsent(lists.readers, name);
+        if (ace.canWrite() && !before.ofWriting(ace.href())) addIfAbsent(lists.writers, name);
     }
     return lists;
 }
@@ -171,7 +196,8 @@ bool StoreAccessLists::dropUnknown(const Url& name, OnStore& found, std::vector<
 }
 
 // The entries in their order, because the first one that decides counts (RFC 3744 section 6). Those of names stay where
-// they are; new names come last, but before everybody is denied something.
+// they are, unless a denial before them takes what they are to grant; such ones and new names come last, but before the
+// first denial that concerns them.
 std::string StoreAccessLists::entriesWith(const OnStore& found, const AccessLists& wanted) const {
     std::vector<std::string> missing = wanted.readers;
     for (const std::string& writer : wanted.writers) addIfAbsent(missing, writer);
@@ -180,22 +206,32 @@ std::string StoreAccessLists::entriesWith(const OnStore& found, const AccessList
         return grantTo(found.principals->hrefFor(who).value_or(std::string()), contains(wanted.readers, who),
                        contains(wanted.writers, who));
     };
-    std::vector<std::string> entries;
-    std::optional<size_t> end; // where everybody is denied something
+    struct Entry {
+        std::string xml;
+        Denials denials; // its own
+    };
+    std::vector<Entry> entries;
+    Denials before;
     for (const CXACE& ace : found.entries) {
-        const bool ours = isOurs(found, ace);
-        const std::string name = ours ? found.principals->nameFor(ace.href()) : std::string();
-        if (!end && deniesEverybody(ace)) end = entries.size();
-        if (!ours)
-            entries.push_back(ace.xml());
-        else if (contains(missing, name))
-            entries.push_back(entryFor(name));
+        before.add(ace);
+        if (!isOurs(found, ace)) {
+            entries.push_back({ace.xml(), {}});
+            entries.back().denials.add(ace);
+            continue;
+        }
+        const std::string name = found.principals->nameFor(ace.href());
+        const bool taken = (contains(wanted.readers, name) && before.ofReading(ace.href())) ||
+                           (contains(wanted.writers, name) && before.ofWriting(ace.href()));
+        if (contains(missing, name) && !taken) entries.push_back({entryFor(name), {}});
     }
-    std::string added;
-    for (const std::string& who : std::vector<std::string>(missing)) added += entryFor(who);
-    entries.insert(entries.begin() + static_cast<ptrdiff_t>(end.value_or(entries.size())), added);
+    for (const std::string& who : std::vector<std::string>(missing)) {
+        const std::string href = found.principals->hrefFor(who).value_or(std::string());
+        const auto place = std::find_if(entries.begin(), entries.end(),
+                                        [&](const Entry& entry) { return entry.denials.ofAnything(href); });
+        entries.insert(place, {entryFor(who), {}});
+    }
     std::string all;
-    for (const std::string& entry : entries) all += entry;
+    for (const Entry& entry : entries) all += entry.xml;
     return all;
 }
 

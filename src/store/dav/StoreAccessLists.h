@@ -14,7 +14,8 @@ namespace rolvane {
 
 class StorePrincipals;
 
-// The account names on an access list: who may read, and who may do everything. In order, without duplicates.
+// The account names on an access list: who may read, and who may do everything. In order, without duplicates, and
+// without those from whom an entry before theirs takes it.
 struct AccessLists {
     std::vector<std::string> readers, writers;
     friend bool operator==(const AccessLists&, const AccessLists&) = default;

@@ -10,6 +10,30 @@ namespace {
 void silent(void*, const char*, ...) {}
 void silentStructured(void*, xmlErrorPtr) {}
 
+// What libxml2 finds wrong with an encoding it writes to standard error, by handlers of the thread and not by the
+// parser's. They are other ones as long as this lives.
+class Silence {
+public:
+    Silence()
+        : _generic(xmlGenericError), _genericContext(xmlGenericErrorContext), _structured(xmlStructuredError),
+          _structuredContext(xmlStructuredErrorContext) {
+        xmlSetGenericErrorFunc(nullptr, silent);
+        xmlSetStructuredErrorFunc(nullptr, silentStructured);
+    }
+    ~Silence() {
+        xmlSetGenericErrorFunc(_genericContext, _generic);
+        xmlSetStructuredErrorFunc(_structuredContext, _structured);
+    }
+    Silence(const Silence&) = delete;
+    Silence& operator=(const Silence&) = delete;
+
+private:
+    xmlGenericErrorFunc _generic;
+    void* _genericContext;
+    xmlStructuredErrorFunc _structured;
+    void* _structuredContext;
+};
+
 // libxml2 hands an ampersand in the value of an attribute over as "&#38;".
 std::string plainURI(std::string_view uri) {
     constexpr std::string_view kAmpersand = "&#38;";
@@ -51,6 +75,7 @@ XmlSax::~XmlSax() {
 }
 
 bool XmlSax::feed(std::string_view bytes) {
+    const Silence silence;
     while (_good && !bytes.empty()) {
         const size_t n = std::min<size_t>(bytes.size(), 1u << 20);
         if (xmlParseChunk(_context, bytes.data(), static_cast<int>(n), 0) != 0) _good = false;
@@ -60,6 +85,7 @@ bool XmlSax::feed(std::string_view bytes) {
 }
 
 bool XmlSax::finish() {
+    const Silence silence;
     if (_good && xmlParseChunk(_context, nullptr, 0, 1) != 0) _good = false;
     return _good && _context->wellFormed == 1;
 }
