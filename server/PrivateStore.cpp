@@ -237,8 +237,9 @@ bool PrivateStore::Implementation::tryStart(int port, const StoreIdentity& ident
     unlink(pidFile().c_str());
     makeTrees(identity);
     const size_t logStart = sizeOf(errorLog());
-    const StoreProcess process = StoreProcess::launch(
-        {options.httpdProgram, "-d", state, "-f", configurationFile(), "-DFOREGROUND"}, identity, outputFile());
+    const StoreProcess process =
+        StoreProcess::launch({options.httpdProgram, "-d", state, "-f", configurationFile(), "-DFOREGROUND"}, identity,
+                             outputFile(), options.environment);
     try {
         waitUntilReady(process, port, logStart);
     } catch (const CXException&) {

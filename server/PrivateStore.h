@@ -36,6 +36,7 @@ struct PrivateStoreOptions {
 
     bool ownsProcess = false; // the destructor stops the store (tests); else it goes on running
     std::chrono::seconds certificateLifetime{std::chrono::hours(24 * 365 * 5)};
+    std::vector<std::string> environment; // "NAME=value" for httpd, not kept from one start to the next
     std::string httpdProgram = "/usr/sbin/apache2";
     std::string httpdModules = "/usr/lib/apache2/modules";
     std::string configurationTemplate; // a file; "" = the one that was built or installed with the program

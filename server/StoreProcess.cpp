@@ -64,8 +64,16 @@ void allowDescriptors() {
     setrlimit(RLIMIT_NOFILE, &limit);
 }
 
-[[noreturn]] void runChild(char* const* arguments, const StoreIdentity& identity, int output, int report) {
+// Requests carry passwords, and so would a core file.
+void forbidCoreFiles() {
+    const rlimit none{0, 0};
+    setrlimit(RLIMIT_CORE, &none);
+}
+
+[[noreturn]] void runChild(char* const* arguments, char* const* environment, const StoreIdentity& identity, int output,
+                           int report) {
     setsid();
+    forbidCoreFiles();
     umask(0077);
     allowDescriptors();
     sigset_t none;
@@ -79,7 +87,7 @@ void allowDescriptors() {
     dup2(report, 3);
     close_range(4, ~0u, 0);
     fcntl(3, F_SETFD, FD_CLOEXEC);
-    if (becomeIdentity(identity) && chdir("/") == 0) execv(arguments[0], arguments);
+    if (becomeIdentity(identity) && chdir("/") == 0) execve(arguments[0], arguments, environment);
     const int error = errno;
     [[maybe_unused]] const ssize_t written = write(3, &error, sizeof error);
     _exit(127);
@@ -178,7 +186,7 @@ std::vector<StoreProcess> StoreProcess::findAll(const std::string& configuration
 }
 
 StoreProcess StoreProcess::launch(const std::vector<std::string>& command, const StoreIdentity& identity,
-                                  const std::string& outputFile) {
+                                  const std::string& outputFile, std::vector<std::string> environment) {
     // A new file, whatever was there: its old one may have another name somewhere else.
     unlink(outputFile.c_str());
     FileHandle output(open(outputFile.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0600));
@@ -193,10 +201,15 @@ StoreProcess StoreProcess::launch(const std::vector<std::string>& command, const
     std::vector<char*> arguments;
     for (const auto& argument : command) arguments.push_back(const_cast<char*>(argument.c_str()));
     arguments.push_back(nullptr);
+    environment.insert(environment.begin(), {"PATH=/usr/local/bin:/usr/bin:/bin", "LANG=C"});
+    if (const char* zone = getenv("TZ")) environment.push_back(std::string("TZ=") + zone); // of the logs
+    std::vector<char*> variables;
+    for (auto& variable : environment) variables.push_back(variable.data());
+    variables.push_back(nullptr);
 
     const pid_t pid = fork();
     if (pid < 0) fail(std::string("The store cannot be started: ") + std::strerror(errno) + ".");
-    if (pid == 0) runChild(arguments.data(), identity, output.get(), writing.get());
+    if (pid == 0) runChild(arguments.data(), variables.data(), identity, output.get(), writing.get());
 
     writing = FileHandle();
     int error = 0;

@@ -54,9 +54,11 @@ public:
     // Every such process of this machine: httpd's master and its workers.
     static std::vector<StoreProcess> findAll(const std::string& configurationFile);
     // Starts it in a session of its own, standard error and output in the file, no other descriptor inherited.
-    // CXException when it cannot be run.
+    // Its environment is a path, a language, TZ and the given variables ("NAME=value") and holds nothing else of this
+    // process's: who serves others' requests need not know it. It leaves no core files. CXException when it cannot be
+    // run.
     static StoreProcess launch(const std::vector<std::string>& command, const StoreIdentity& identity,
-                               const std::string& outputFile);
+                               const std::string& outputFile, std::vector<std::string> environment = {});
 
     pid_t pid() const { return _pid; }
     bool hasExited() const { return waitForExit(std::chrono::milliseconds(0)); }

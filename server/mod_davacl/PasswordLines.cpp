@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <ctime>
 #include <fcntl.h>
+#include <iterator>
 #include <unistd.h>
 
 namespace rolvane::davacl {
@@ -56,6 +57,13 @@ PasswordHashes passwordHashes(std::string_view text) {
     return hashes;
 }
 
+std::string hashInstead(const PasswordHashes& hashes, uint64_t number) {
+    // Of a random password that nobody knows, with the cost that the private store uses.
+    constexpr const char* kNobodys = "$2y$10$xrCjQIp6x6sZd06o8G6sMOimJvwB/nwR18YXUwNsPuDRj4GA68g2u";
+    if (hashes.empty()) return kNobodys;
+    return std::next(hashes.begin(), static_cast<ptrdiff_t>(number % hashes.size()))->second;
+}
+
 std::shared_ptr<const PasswordHashes> PasswordLines::read(const std::string& path) {
     struct stat state {};
     const std::lock_guard lock(_mutex);
@@ -76,9 +84,9 @@ std::shared_ptr<const PasswordHashes> PasswordLines::read(const std::string& pat
 
 PasswordLines::Found PasswordLines::find(const std::string& path, std::string_view user) {
     const auto hashes = read(path);
-    if (!hashes) return {Answer::unreadable, {}};
+    if (!hashes) return {};
     const auto found = hashes->find(user);
-    if (found == hashes->end()) return {Answer::unknown, {}};
+    if (found == hashes->end()) return {Answer::unknown, {}, hashes};
     return {Answer::known, found->second};
 }
 

@@ -6,6 +6,7 @@
 
 #include <apr_md5.h>
 #include <array>
+#include <functional>
 #include <mutex>
 #include <string>
 
@@ -26,6 +27,11 @@ std::mutex& turnOf(const SignInMemory::Mark& mark) {
     return (*all)[mark[1] % all->size()];
 }
 
+// The same for a name as long as the server's configuration is in force, and known to nobody.
+uint64_t numberOf(const char* user) {
+    return memory ? memory->markOf(user, {}, {})[0] : std::hash<std::string_view>()(user);
+}
+
 apr_status_t forget(void* mapped) {
     static_cast<SignInMemory*>(mapped)->unmap();
     if (memory == mapped) memory = nullptr;
@@ -43,17 +49,21 @@ authn_status check(request_rec* r, const char* user, const char* password) {
         ap_log_rerror(APLOG_MARK, APLOG_ERR, 0, r, "davacl: the password file %s cannot be read", path);
         return AUTH_GENERAL_ERROR;
     }
-    if (found.answer == PasswordLines::Answer::unknown) return AUTH_USER_NOT_FOUND;
+    const bool known = found.answer == PasswordLines::Answer::known;
+    const std::string hash = known ? found.hash : hashInstead(*found.others, numberOf(user));
     const auto isRight = [&] {
         ap_log_rerror(APLOG_MARK, APLOG_DEBUG, 0, r, "davacl: the password of %s is checked in full", user);
-        return apr_password_validate(password, found.hash.c_str()) == APR_SUCCESS;
+        const bool right = apr_password_validate(password, hash.c_str()) == APR_SUCCESS;
+        return right && known;
     };
-    if (!memory) return isRight() ? AUTH_GRANTED : AUTH_DENIED;
-    const SignInMemory::Mark mark = memory->markOf(user, found.hash, password);
-    if (memory->knows(mark)) return AUTH_GRANTED;
+    const auto refused = known ? AUTH_DENIED : AUTH_USER_NOT_FOUND;
+    if (!memory) return isRight() ? AUTH_GRANTED : refused;
+    // Who is not known goes the same way, at the same cost, to another end.
+    const SignInMemory::Mark mark = memory->markOf(user, hash, password);
+    if (memory->knows(mark) && known) return AUTH_GRANTED;
     const std::lock_guard turn(turnOf(mark));
-    if (memory->knows(mark)) return AUTH_GRANTED;
-    if (!isRight()) return AUTH_DENIED;
+    if (memory->knows(mark) && known) return AUTH_GRANTED;
+    if (!isRight()) return refused;
     memory->remember(mark);
     return AUTH_GRANTED;
 }

@@ -1,11 +1,19 @@
 #include "daemon/CheckIn.h"
 
+#include "foundation/ControlSocket.h"
+#include "foundation/Log.h"
+
 #include <cerrno>
+#include <cstddef>
+#include <cstring>
 #include <fcntl.h>
 #include <map>
 #include <memory>
+#include <string>
 #include <sys/eventfd.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
 #include <utility>
@@ -47,12 +55,36 @@ void acceptPeers(RunLoop& loop, int fd, const std::shared_ptr<Peers>& peers) {
             if (errno == EINTR || errno == ECONNABORTED) continue;
             return;
         }
+        if (!isOfThisUser(peer)) {
+            ::close(peer);
+            continue;
+        }
         if (peers->size() == kMostWaiting) letGo(*peers, peers->begin()->first);
         (*peers)[peer] = loop.addPort(peer, [peer, own = std::weak_ptr(peers)](uint32_t) {
             drain(peer);
             if (const auto held = own.lock()) letGo(*held, peer);
         });
     }
+}
+
+// Whether a local socket with this path, or its other end where it has none, is this user's.
+bool isSocketOfThisUser(int fd) {
+    sockaddr_un address{};
+    socklen_t size = sizeof address;
+    if (::getsockname(fd, reinterpret_cast<sockaddr*>(&address), &size) != 0 || address.sun_family != AF_UNIX)
+        return false;
+    constexpr size_t kHead = offsetof(sockaddr_un, sun_path);
+    if (size <= kHead) return isOfThisUser(fd);    // one of a pair
+    if (address.sun_path[0] == '\0') return false; // a name that anybody may take, and that anybody reaches
+    const std::string path(address.sun_path, ::strnlen(address.sun_path, size - kHead));
+    struct stat info {};
+    return path[0] == '/' && ::lstat(path.c_str(), &info) == 0 && S_ISSOCK(info.st_mode) && info.st_uid == ::geteuid();
+}
+
+bool isFifoOfThisUser(int fd) {
+    struct stat info {};
+    return sd_is_fifo(fd, nullptr) > 0 && ::fstat(fd, &info) == 0 && info.st_uid == ::geteuid() &&
+           (::fcntl(fd, F_GETFL) & O_ACCMODE) != O_WRONLY;
 }
 
 void makeNonBlocking(int fd) {
@@ -75,8 +107,11 @@ CheckInPorts CXDCheckIn(RunLoop& loop) {
     const int passed = sd_listen_fds(1);
     for (int i = 0; i < passed; ++i) {
         const int fd = SD_LISTEN_FDS_START + i;
-        const bool listening = sd_is_socket(fd, AF_UNSPEC, SOCK_STREAM, 1) > 0;
-        if (!listening && sd_is_socket(fd, AF_UNSPEC, 0, -1) <= 0 && sd_is_fifo(fd, nullptr) <= 0) continue;
+        if (!isSocketOfThisUser(fd) && !isFifoOfThisUser(fd)) {
+            CXDLog("Descriptor %d of the service launcher is none of this user's and is left alone.", fd);
+            continue;
+        }
+        const bool listening = sd_is_socket(fd, AF_UNIX, SOCK_STREAM, 1) > 0;
         makeNonBlocking(fd);
         const bool mayEnd = !listening && endsWithItsPeer(fd);
         const auto source = std::make_shared<RunLoop::Handle>();

@@ -26,6 +26,8 @@ private:
 };
 
 // Checks in with the service launcher (sd_listen_fds) and schedules each socket that it passed as a source of the loop.
+// A descriptor that is not this user's own is left as it is: one of the network, an abstract name, a path or a FIFO of
+// somebody else's. Only programs of this user are listened to.
 // Started without a launcher, or handed nothing usable, the process gets an idle source of its own, so that the loop
 // waits all the same. Failures are silent.
 CheckInPorts CXDCheckIn(RunLoop& loop);

@@ -4,9 +4,21 @@
 
 #include <cstdlib>
 
+#include <sys/socket.h>
+#include <unistd.h>
+
 namespace rolvane {
 
 namespace {
+
+// Who serves the bus, as the kernel knows it; nobody where the bus is not reached by a socket of this machine.
+bool isOfThisUserOrRoot(sd_bus* bus) {
+    ucred peer{};
+    socklen_t size = sizeof peer;
+    const int fd = sd_bus_get_fd(bus);
+    return fd >= 0 && ::getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &peer, &size) == 0 &&
+           (peer.uid == ::geteuid() || peer.uid == 0);
+}
 
 using Steady = std::chrono::steady_clock;
 constexpr int kMostSteps = 1000;
@@ -39,6 +51,7 @@ Bus connectBus(const std::string& address, std::chrono::milliseconds limit) {
     if (sd_bus_set_address(made, address.c_str()) < 0 || sd_bus_set_bus_client(made, 1) < 0 || sd_bus_start(made) < 0)
         return nullptr;
     sd_bus_set_exit_on_disconnect(made, 0);
+    if (!isOfThisUserOrRoot(made)) return nullptr;
     while (pumpBus(made)) {
         if (sd_bus_is_ready(made) > 0) return bus;
         uint64_t left = microsecondsUntil(deadline);

@@ -17,8 +17,9 @@ using Bus = std::unique_ptr<sd_bus, BusCloser>;
 // The address of the environment's session bus; none when it names none.
 std::optional<std::string> sessionBusAddress();
 
-// A connection that is ready for messages; none when there is no bus at the address or it does not answer in time.
-// Does not end the process when the bus goes away.
+// A connection that is ready for messages; none when there is no bus at the address, it does not answer in time, or its
+// program is somebody else's than this user's or root's: on the bus of another user (one whose environment was
+// inherited) that user would hear what is said there, and could speak. Does not end the process when the bus goes away.
 Bus connectBus(const std::string& address, std::chrono::milliseconds limit);
 
 // Reads and writes what is possible without waiting. False when the bus is gone.

@@ -14,6 +14,7 @@ namespace rolvane {
 
 namespace {
 
+constexpr int kBacklogATurn = 64;
 constexpr int kRestMilliseconds = 1000; // when no descriptor is left for another peer
 
 } // namespace
@@ -111,7 +112,7 @@ void ControlServer::serve() {
 }
 
 bool ControlServer::accept() {
-    for (;;) {
+    for (int turn = 0; turn < kBacklogATurn; ++turn) {
         OwnedDescriptor socket(::accept4(_listening.get(), nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK));
         if (!socket) {
             if (errno == EINTR || errno == ECONNABORTED) continue;
@@ -122,6 +123,7 @@ bool ControlServer::accept() {
         const int fd = socket.get();
         _peers[fd].socket = std::move(socket);
     }
+    return true;
 }
 
 // Reader and socket are this thread's alone; the rest of a peer is touched under the lock.
@@ -129,11 +131,12 @@ void ControlServer::read(Peer& peer) {
     char bytes[16384];
     bool ended = false;
     try {
-        for (;;) {
+        for (size_t turn = 0; turn < kMostATurn;) {
             const ssize_t n = ::recv(peer.socket.get(), bytes, sizeof bytes, MSG_DONTWAIT);
             if (n < 0 && errno == EINTR) continue;
             ended = n == 0 || (n < 0 && errno != EAGAIN && errno != EWOULDBLOCK);
             if (n <= 0) break;
+            turn += static_cast<size_t>(n);
             peer.reader.append({bytes, static_cast<size_t>(n)});
             while (const auto message = peer.reader.next()) answer(peer, *message);
         }
@@ -147,6 +150,8 @@ void ControlServer::read(Peer& peer) {
 
 void ControlServer::answer(Peer& peer, const ControlMessage& message) {
     using Kind = ControlMessage::Kind;
+    if (message.names.size() > kMostNames)
+        throw CXException(kCXArchiveException, "A message on the control socket names too much.");
     ControlMessage heard;
     heard.kind = Kind::heard;
     heard.number = message.number;

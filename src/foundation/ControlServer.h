@@ -16,12 +16,16 @@ namespace rolvane {
 // main thread is busy with a pass.
 //
 // Bounds: at most kMostPeers at a time, the next ones are let go at once; a peer that does not read loses progress
-// first (names that `mayBeDropped`), and the connection when more than kMostWaiting bytes wait for it.
+// first (names that `mayBeDropped`), and the connection when more than kMostWaiting bytes wait for it. A peer that does
+// nothing but send is read kMostATurn bytes at a time, and the others have their turns in between. Who observes more
+// than kMostNames names is let go.
 class ControlServer {
 public:
     static constexpr size_t kMostPeers = 128;
     static constexpr size_t kMostWaiting = size_t{4} << 20;
     static constexpr size_t kDropsFrom = size_t{256} << 10;
+    static constexpr size_t kMostATurn = size_t{64} << 10;
+    static constexpr size_t kMostNames = 100;
 
     struct Callbacks { // on the server's thread
         std::function<void(const Notification&)> arrived;

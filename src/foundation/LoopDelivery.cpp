@@ -1,11 +1,43 @@
 #include "foundation/LoopDelivery.h"
 
+#include "foundation/Log.h"
+
+#include <algorithm>
+
 #include <sys/eventfd.h>
 #include <unistd.h>
 
 namespace rolvane {
 
+namespace {
+
+constexpr size_t kOfAValue = 16; // at least
+
+// Takes the value's size from what is left; false when that is not enough.
+bool takeSize(const Value& value, size_t& left) {
+    size_t own = kOfAValue;
+    if (auto* text = value.stringIf()) own += text->size();
+    if (value.type() == ValueType::data) own += value.data().size();
+    if (own > left) return false;
+    left -= own;
+    const auto fits = [&](const Value& each) { return takeSize(each, left); };
+    if (auto* array = value.arrayIf()) return std::all_of(array->begin(), array->end(), fits);
+    auto* dictionary = value.dictionaryIf();
+    return !dictionary || std::all_of(dictionary->begin(), dictionary->end(), [&](const auto& entry) {
+        return takeSize(Value(entry.first), left) && fits(entry.second);
+    });
+}
+
+bool isTooLarge(const Notification& notification) {
+    size_t left = LoopDelivery::kMostBytes;
+    return (notification.object && !takeSize(Value(*notification.object), left)) ||
+           !takeSize(Value(notification.userInfo), left);
+}
+
+} // namespace
+
 bool SeenPosts::isNew(const std::string& id) {
+    if (id.size() > kLongest) return true;
     if (!_seen.insert(id).second) return false;
     _order.push_back(id);
     if (_order.size() > kMost) {
@@ -31,6 +63,12 @@ LoopDelivery::~LoopDelivery() {
 
 // False for one that has come already.
 bool LoopDelivery::enqueue(Notification notification) {
+    if (isTooLarge(notification)) {
+        if (!_largeLogged.exchange(true))
+            CXLog("A notification %@ is larger than %@ bytes and is not delivered. Others are not logged.",
+                  notification.name, kMostBytes);
+        return false;
+    }
     if (auto* id = notification.userInfo[kPostIdKey].stringIf()) {
         const std::string known = *id;
         notification.userInfo.remove(kPostIdKey);

@@ -3,6 +3,7 @@
 #include "foundation/DeliveryQueue.h"
 #include "foundation/RunLoop.h"
 
+#include <atomic>
 #include <deque>
 #include <unordered_set>
 
@@ -16,7 +17,8 @@ inline constexpr const char* kPostIdKey = "postId";
 class SeenPosts {
 public:
     static constexpr size_t kMost = 20'000;
-    bool isNew(const std::string& id); // true once for each id
+    static constexpr size_t kLongest = 100; // bytes of an id that is remembered; ours have 57 at most
+    bool isNew(const std::string& id);      // true once for each id; always for one that is too long
 
 private:
     std::unordered_set<std::string> _seen;
@@ -24,9 +26,12 @@ private:
 };
 
 // The observers of a distributed centre on their run loop, and what waits for them, by whichever carrier it came. Who
-// comes by two of them is delivered once. Owned by the centre and shared with its carriers.
+// comes by two of them is delivered once. What has more than kMostBytes is not delivered, whoever sends it. Owned by
+// the centre and shared with its carriers.
 class LoopDelivery : public std::enable_shared_from_this<LoopDelivery> {
 public:
+    static constexpr size_t kMostBytes = size_t{1} << 20; // as much as a message on the control socket
+
     explicit LoopDelivery(RunLoop& loop);
     ~LoopDelivery();
     LoopDelivery(const LoopDelivery&) = delete;
@@ -46,6 +51,7 @@ private:
 
     RunLoop& _loop;
     DeliveryQueue _queue;
+    std::atomic<bool> _largeLogged = false;
     std::mutex _seenMutex;
     SeenPosts _seen; // guarded by _seenMutex
     bool _suspended = false;

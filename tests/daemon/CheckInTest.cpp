@@ -8,6 +8,7 @@
 #include <cstring>
 #include <fcntl.h>
 #include <fstream>
+#include <netinet/in.h>
 #include <poll.h>
 #include <sstream>
 #include <sys/socket.h>
@@ -132,6 +133,72 @@ TEST_F(CheckIn, WhatCannotBeWatchedIsIgnoredSilently) {
     EXPECT_FALSE(process->wait(0.2)) << process->errors();
     EXPECT_EQ(linesWith(process->errors(), "xception"), 0U) << process->errors();
 }
+
+// A descriptor whose owner still uses it: nothing of it is read, and no flag of it is changed.
+class ForeignDescriptor : public CheckIn, public testing::WithParamInterface<const char*> {
+protected:
+    // A socket that is foreign to the user, and how somebody sends to it.
+    static int networkListener() {
+        const int fd = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+        sockaddr_in address{};
+        address.sin_family = AF_INET;
+        address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+        EXPECT_EQ(::bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+        EXPECT_EQ(::listen(fd, 5), 0);
+        return fd;
+    }
+    static int networkDatagrams() {
+        const int fd = ::socket(AF_INET6, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+        return fd >= 0 ? fd : ::socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+    }
+    static int abstractListener() {
+        const int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+        sockaddr_un address{};
+        address.sun_family = AF_UNIX; // the kernel finds a name
+        EXPECT_EQ(::bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof address.sun_family), 0);
+        EXPECT_EQ(::listen(fd, 5), 0);
+        return fd;
+    }
+    // Its path has been taken by something else since.
+    int movedListener() {
+        const std::string path = world.home / "moved";
+        const int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+        const sockaddr_un address = addressOf(path);
+        EXPECT_EQ(::bind(fd, reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+        EXPECT_EQ(::listen(fd, 5), 0);
+        ::unlink(path.c_str());
+        std::ofstream(path) << "a file\n";
+        return fd;
+    }
+    static int pipeToWriteTo() {
+        int ends[2];
+        EXPECT_EQ(::pipe2(ends, O_CLOEXEC), 0);
+        ::close(ends[0]);
+        return ends[1];
+    }
+    int make() {
+        const std::string kind = GetParam();
+        return kind == "NetworkListener"    ? networkListener()
+               : kind == "NetworkDatagrams" ? networkDatagrams()
+               : kind == "AbstractListener" ? abstractListener()
+               : kind == "MovedListener"    ? movedListener()
+                                            : pipeToWriteTo();
+    }
+};
+
+TEST_P(ForeignDescriptor, IsLeftAlone) {
+    const Socket foreign(make());
+    const int flags = ::fcntl(foreign.get(), F_GETFL);
+    const auto process = startedWith(foreign.get());
+    ASSERT_TRUE(process->waitForLine(kServing)) << process->errors();
+    EXPECT_EQ(linesWith(process->errors(), "is left alone"), 1U) << process->errors();
+    EXPECT_EQ(::fcntl(foreign.get(), F_GETFL), flags);
+}
+
+INSTANTIATE_TEST_SUITE_P(Each, ForeignDescriptor,
+                         testing::Values("NetworkListener", "NetworkDatagrams", "AbstractListener", "MovedListener",
+                                         "PipeToWriteTo"),
+                         [](const auto& info) { return std::string(info.param); });
 
 TEST_F(CheckIn, APeerThatHasClosedIsForgottenAndCostsNothing) {
     int ends[2];

@@ -1,4 +1,5 @@
 #include "foundation/CXException.h"
+#include "foundation/LoopDelivery.h"
 #include "foundation/Notification.h"
 #include "foundation/RunLoop.h"
 #include "support/CapturingLog.h"
@@ -8,7 +9,11 @@
 #include "support/WaitUntil.h"
 
 #include <chrono>
+#include <fstream>
 #include <thread>
+
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include <gtest/gtest.h>
 
@@ -142,6 +147,61 @@ TEST_F(Bus, AnIndependentProgramSeesTheSignalAsDocumented) {
           "\"type\":\"a{sv}\"", R"("progress":{"type":"d","data":5)", R"("remoteLocation":{"type":"s","data":"local")"})
         EXPECT_NE(line->find(part), std::string::npos) << part << " in " << *line;
 }
+
+TEST_F(Bus, WhatIsLargerThanAMessageOfTheControlSocketIsNotDelivered) {
+    const CapturingLog log;
+    auto observation = listen("News");
+    const std::string large(LoopDelivery::kMostBytes, 'x');
+    center->post({"News", {}, {{"text", large}}});
+    center->post({"News", large, {}});
+    center->post({"News", {}, {{large, 1}}});
+    Array many;
+    for (size_t i = 0; i < LoopDelivery::kMostBytes / 10; ++i) many.append(true);
+    center->post({"News", {}, {{"list", many}}});
+    center->post({"News", {}, {{"text", std::string(LoopDelivery::kMostBytes / 2, 'x')}}});
+    ASSERT_TRUE(hear(1));
+    ASSERT_TRUE(settle());
+    EXPECT_EQ(heard.size(), 1U);
+    EXPECT_NE(log.text().find("is larger than"), std::string::npos);
+}
+
+TEST(SeenPosts, RemembersNoIdThatIsLongerThanOurs) {
+    SeenPosts seen;
+    EXPECT_TRUE(seen.isNew("an id"));
+    EXPECT_FALSE(seen.isNew("an id"));
+    const std::string large(SeenPosts::kLongest + 1, 'x');
+    EXPECT_TRUE(seen.isNew(large));
+    EXPECT_TRUE(seen.isNew(large)) << "it was kept";
+}
+
+// Only root can have a bus of another user's made, so there are tests of it where root runs them.
+class BusOfAnotherUser : public testing::TestWithParam<int> {};
+
+TEST_P(BusOfAnotherUser, IsNeitherSpokenToNorListenedTo) {
+    TempDirectory directory;
+    ASSERT_EQ(::chmod(directory.path().c_str(), 0777), 0);
+    const std::string socket = directory / "bus", number = std::to_string(GetParam());
+    std::ofstream(directory / "bus.conf")
+        << "<busconfig><type>session</type><listen>unix:path=" << socket
+        << "</listen><auth>EXTERNAL</auth><policy context=\"default\"><allow user=\"*\"/>"
+           "<allow send_destination=\"*\" eavesdrop=\"true\"/><allow eavesdrop=\"true\"/><allow own=\"*\"/></policy>"
+           "</busconfig>";
+    ChildProcess bus({"setpriv", "--reuid=" + number, "--regid=" + number, "--clear-groups", "dbus-daemon",
+                      "--config-file=" + (directory / "bus.conf"), "--nofork", "--nopidfile", "--print-address=1"});
+    ASSERT_TRUE(bus.waitForLine("^unix:", 30)) << bus.errors();
+    // Others of this user's programs do get in.
+    ChildProcess other({"busctl", "--address=unix:path=" + socket, "list"});
+    const auto ending = other.wait();
+    ASSERT_TRUE(ending && ending->exitedWith(0)) << other.errors();
+    RunLoop loop;
+    const auto center = makeBusNotifications(loop, "unix:path=" + socket);
+    EXPECT_FALSE(center->connected());
+    EXPECT_FALSE(center->post({"News", {}, {}}));
+}
+
+GTEST_ALLOW_UNINSTANTIATED_PARAMETERIZED_TEST(BusOfAnotherUser);
+INSTANTIATE_TEST_SUITE_P(Whose, BusOfAnotherUser,
+                         testing::ValuesIn(::geteuid() == 0 ? std::vector{65534} : std::vector<int>()));
 
 TEST_F(Bus, OnlyTheObservedNameIsHeard) {
     auto listening = listen("Wanted");

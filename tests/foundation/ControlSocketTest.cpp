@@ -8,8 +8,10 @@
 #include "support/TempHome.h"
 #include "support/WaitUntil.h"
 
+#include <atomic>
 #include <filesystem>
 #include <random>
+#include <thread>
 
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -387,6 +389,50 @@ TEST_F(Ends, APeerThatTalksNonsenseIsLetGoAndTheOthersGoOn) {
         "the end of the connection"));
     command->post({"Ask", {}, {{"n", 1}}});
     EXPECT_TRUE(hears(1));
+}
+
+// It sends without an end and faster than anybody could read.
+TEST_F(Ends, APeerThatNeverCeasesToSendKeepsNobodyElseWaiting) {
+    start();
+    type();
+    auto asked = listen(*daemon, "Ask");
+    std::string flood;
+    const std::string frame = postOf("N").frame(); // taking it apart costs more than sending it
+    while (flood.size() < (size_t{1} << 20)) flood += frame;
+    const OwnedDescriptor fool = connectToPath(path);
+    ASSERT_TRUE(fool);
+    std::atomic<bool> sent = false;
+    std::jthread sending([&](const std::stop_token& enough) {
+        while (!enough.stop_requested()) {
+            size_t at = 0; // frames stay whole
+            while (at < flood.size() && !enough.stop_requested()) {
+                const ssize_t n = ::send(fool.get(), flood.data() + at, flood.size() - at, MSG_NOSIGNAL);
+                if (n > 0) at += static_cast<size_t>(n);
+            }
+            sent = true;
+        }
+    });
+    ASSERT_TRUE(waitUntil(
+        loop, [&] { return sent.load(); }, "the flood"));
+    for (int i = 0; i < 5; ++i) ASSERT_TRUE(answered(command->postForAnswer({"Ask", {}, {{"n", i}}})));
+    EXPECT_TRUE(hears(5));
+}
+
+TEST_F(Ends, APeerThatObservesTooManyNamesIsLetGo) {
+    start();
+    const OwnedDescriptor fool = connectToPath(path);
+    ControlMessage observe;
+    observe.kind = ControlMessage::Kind::observe;
+    for (size_t i = 0; i <= ControlServer::kMostNames; ++i) observe.names.push_back("Name" + std::to_string(i));
+    const std::string frame = observe.frame();
+    ASSERT_EQ(::send(fool.get(), frame.data(), frame.size(), 0), static_cast<ssize_t>(frame.size()));
+    EXPECT_TRUE(waitUntil(
+        loop,
+        [&] {
+            char byte = 0;
+            return ::recv(fool.get(), &byte, 1, MSG_DONTWAIT) == 0;
+        },
+        "the end of the connection"));
 }
 
 TEST_F(Ends, TenThreadsPostAndEverythingArrivesOnceInTheOrderOfEachThread) {

@@ -38,29 +38,14 @@ PrivateStoreOptions complete(AccessVariant variant, const StoreDirectory& direct
         options.configurationTemplate = directory.path("httpd.conf.in");
         writeFileDurably(options.configurationTemplate, withDbm(readFile(storeTemplatePath())));
     }
-    if (variant == AccessVariant::sanitized) options.accessModule = ROLVANE_SANITIZED_DAVACL;
+    if (variant == AccessVariant::sanitized) {
+        options.accessModule = ROLVANE_SANITIZED_DAVACL;
+        // httpd was itself built without sanitizers, so it loads them before everything else; leaks are its own.
+        options.environment = {std::string("LD_PRELOAD=") + ROLVANE_SANITIZERS, "ASAN_OPTIONS=detect_leaks=0",
+                               "UBSAN_OPTIONS=print_stacktrace=1"};
+    }
     return options;
 }
-
-// What httpd inherits when it starts: it was itself built without sanitizers, so it loads them before everything else.
-class Sanitizers {
-public:
-    explicit Sanitizers(bool wanted) : _wanted(wanted) {
-        if (!_wanted) return;
-        setenv("LD_PRELOAD", ROLVANE_SANITIZERS, 1);
-        setenv("ASAN_OPTIONS", "detect_leaks=0", 1); // httpd's own
-        setenv("UBSAN_OPTIONS", "print_stacktrace=1", 1);
-    }
-    ~Sanitizers() {
-        if (!_wanted) return;
-        for (const char* name : {"LD_PRELOAD", "ASAN_OPTIONS", "UBSAN_OPTIONS"}) unsetenv(name);
-    }
-    Sanitizers(const Sanitizers&) = delete;
-    Sanitizers& operator=(const Sanitizers&) = delete;
-
-private:
-    const bool _wanted;
-};
 
 } // namespace
 
@@ -74,7 +59,6 @@ AccessWorld::AccessWorld(AccessVariant theVariant, PrivateStoreOptions options)
     : variant(theVariant), store(complete(variant, directory, std::move(options))) {
     makeUsers();
     writeFileDurably(store.stateDirectory() + "/conf/groups", "# friends\nreaders: greta\nothers: sam walter\n");
-    const Sanitizers inherited(variant == AccessVariant::sanitized);
     store.start();
 }
 

@@ -3,6 +3,7 @@
 #include "foundation/CXException.h"
 #include "foundation/Paths.h"
 #include "server/StoreConfiguration.h"
+#include "server/StoreProcess.h"
 
 #include <arpa/inet.h>
 #include <chrono>
@@ -619,6 +620,24 @@ TEST(PrivateStore, StartsFromAProgramWithoutStandardDescriptors) {
     int status = 0;
     waitpid(child, &status, 0);
     EXPECT_EQ(status, 0);
+}
+
+// Who serves others' requests need not know what the person who started it has in the environment.
+TEST(PrivateStore, TheServerHasNothingOfTheEnvironmentThatItWasStartedIn) {
+    setenv("ROLVANE_TEST_SECRET", "a key of the person's", 1);
+    const World world;
+    unsetenv("ROLVANE_TEST_SECRET");
+    const auto processes = StoreProcess::findAll(world.store.stateDirectory() + "/conf/httpd.conf");
+    ASSERT_GE(processes.size(), 2u);
+    for (const auto& process : processes) {
+        const std::string number = std::to_string(process.pid());
+        const std::string environment = readFile("/proc/" + number + "/environ");
+        EXPECT_NE(environment.find("PATH="), std::string::npos);
+        for (const char* name : {"SECRET", "HOME=", "USER=", "LD_", "DBUS_"})
+            EXPECT_EQ(environment.find(name), std::string::npos) << environment;
+        EXPECT_NE(readFile("/proc/" + number + "/limits").find("Max core file size        0                    0"),
+                  std::string::npos);
+    }
 }
 
 TEST(PrivateStore, NeverServesAsRoot) {

@@ -10,6 +10,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <memory>
+#include <set>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -120,6 +121,31 @@ TEST_F(SigningIn, ASlowHashIsPaidOnceForAUserAndNotForEachRequest) {
     EXPECT_EQ(fullChecks("alice"), 3u) << "what is wrong is not remembered";
     EXPECT_EQ(world.status("alice", "GET", "/dav/alice/own"), 200);
     EXPECT_EQ(fullChecks("alice"), 3u);
+}
+
+TEST_F(SigningIn, AnUnknownNameIsRefusedAtTheCostOfAKnownOne) {
+    const auto checksFor = [this](const std::string& user) {
+        const size_t before = fullChecks(user);
+        EXPECT_EQ(signIn(user, "wrong"), 401);
+        EXPECT_EQ(signIn(user, "wrong"), 401);
+        return fullChecks(user) - before;
+    };
+    EXPECT_EQ(checksFor("alice"), 2u);
+    EXPECT_EQ(checksFor("mallory"), 2u);
+    // Nobody is let in by somebody else's password.
+    for (const char* name : {"mallory", "trudy", "oscar", "eve"})
+        for (const char* known : {"alice", "walter", "rita", "sam", "greta"})
+            EXPECT_EQ(signIn(name, rawPasswordOf(known)), 401) << name << " with the password of " << known;
+}
+
+TEST(PasswordLines, AnUnknownNameCostsWhatALineOfTheFileCosts) {
+    const davacl::PasswordHashes hashes = davacl::passwordHashes("alice:$2y$10$one\nbob:$apr1$two\n");
+    std::set<std::string> used;
+    for (uint64_t number = 0; number < 4; ++number) used.insert(davacl::hashInstead(hashes, number));
+    EXPECT_EQ(used, (std::set<std::string>{"$2y$10$one", "$apr1$two"}));
+    EXPECT_EQ(davacl::hashInstead(hashes, 7), davacl::hashInstead(hashes, 7));
+    EXPECT_EQ(davacl::hashInstead({}, 7).rfind("$2y$10$", 0), 0u)
+        << "nobody is known: as the private store writes them";
 }
 
 TEST_F(SigningIn, AChangedPasswordIsRefusedAtTheNextRequest) {

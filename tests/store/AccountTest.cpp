@@ -11,7 +11,9 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <rapidcheck.h>
+#include <sys/prctl.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 
 namespace rolvane {
 namespace {
@@ -160,6 +162,56 @@ TEST(Account, PasswordsComeFromTheirSources) {
     EXPECT_THAT(reasonOf({Kind::credential, "../pw"}), HasSubstr("cannot be the name"));
     home.setVariable("CREDENTIALS_DIRECTORY", std::nullopt);
     EXPECT_THAT(reasonOf({Kind::credential, "pw"}), HasSubstr("LoadCredential"));
+}
+
+// What is the daemon's own, and what makes a shell run something else, is not the command's; a manager's session is.
+TEST(Account, APasswordCommandGetsThePersonsEnvironmentWithoutWhatLeadsItAstray) {
+    TempHome home;
+    std::ofstream(home / "astray") << "echo astray\n";
+    for (const auto& [name, value] :
+         std::initializer_list<std::pair<const char*, std::string>>{{"LD_LIBRARY_PATH", "/nonexistent"},
+                                                                    {"NOTIFY_SOCKET", "@somewhere"},
+                                                                    {"LISTEN_FDS", "1"},
+                                                                    {"LISTEN_PID", "1"},
+                                                                    {"ENV", home / "astray"},
+                                                                    {"BASH_ENV", home / "astray"},
+                                                                    {"BASH_FUNC_echo%%", "() { printf astray; }"},
+                                                                    {"GLIBC_TUNABLES", "glibc.malloc.check=0"},
+                                                                    {"BW_SESSION", "a session"},
+                                                                    {"SSH_AUTH_SOCK", "/run/agent"}})
+        home.setVariable(name, value);
+    const std::string all = reasonOf({PasswordSource::Kind::command, "env | tr '\\n' '|'"});
+    for (const char* gone : {"LD_", "NOTIFY_SOCKET", "LISTEN_", "|ENV=", "BASH_ENV", "BASH_FUNC", "GLIBC_TUNABLES"})
+        EXPECT_THAT(all, testing::Not(HasSubstr(gone)));
+    for (const char* kept : {"BW_SESSION=a session", "SSH_AUTH_SOCK=/run/agent", "HOME="})
+        EXPECT_THAT(all, HasSubstr(kept));
+    const auto path = [&](const std::string& value) {
+        home.setVariable("PATH", value);
+        return reasonOf({PasswordSource::Kind::command, "echo \"$PATH\""});
+    };
+    EXPECT_EQ(path(".:/usr/bin::bin:/bin:"), "password: /usr/bin:/bin");
+    EXPECT_EQ(path("."), "password: /usr/local/bin:/usr/bin:/bin");
+}
+
+TEST(Account, WhoHoldsAPasswordLeavesNoCoreFile) {
+    using Kind = PasswordSource::Kind;
+    const auto dumpableAfter = [](const PasswordSource& source) {
+        const pid_t child = ::fork();
+        if (child == 0) {
+            ::prctl(PR_SET_DUMPABLE, 1, 0, 0, 0); // whatever was read here before
+            (void)reasonOf(source);
+            std::_Exit(::prctl(PR_GET_DUMPABLE, 0, 0, 0, 0));
+        }
+        int status = -1;
+        ::waitpid(child, &status, 0);
+        return WEXITSTATUS(status);
+    };
+    EXPECT_EQ(dumpableAfter({Kind::none, ""}), 1) << "the test would see nothing";
+    EXPECT_EQ(dumpableAfter({Kind::command, "echo word"}), 0);
+    TempHome home;
+    std::ofstream(home / "pw") << "word\n";
+    chmod((home / "pw").c_str(), 0600);
+    EXPECT_EQ(dumpableAfter({Kind::file, home / "pw"}), 0);
 }
 
 TEST(Account, LoopbackIsToldByAddress) {

@@ -106,7 +106,10 @@ TEST(HostileStore, WritesNothingToTheStandardErrorOfItsReader) {
         "<p:x/>",
         "<x xmlns:a=\"not a uri %\" xmlns:a=\"b\" c=\"<\"/>"};
     testing::internal::CaptureStderr();
-    for (const std::string& body : bodies) (void)parseDAVTree(body);
+    for (const std::string& body : bodies) {
+        (void)parseDAVTree(body);
+        EXPECT_THROW(PropertyList::fromXML(body), CXException);
+    }
     EXPECT_EQ(testing::internal::GetCapturedStderr(), "");
 }
 

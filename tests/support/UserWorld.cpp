@@ -125,9 +125,11 @@ std::optional<pid_t> UserWorld::daemon() {
     std::ifstream file(path);
     pid_t pid = 0;
     if (!(file >> pid) || pid <= 0) return std::nullopt;
-    std::error_code none;
-    const fs::path program = fs::read_symlink("/proc/" + std::to_string(pid) + "/exe", none);
-    return program == fs::canonical(managerProgram(), none) ? std::optional(pid) : std::nullopt;
+    // Its program cannot be read by others than root while it holds a password; its name and its command line can.
+    std::ifstream line("/proc/" + std::to_string(pid) + "/cmdline");
+    std::string program;
+    std::getline(line, program, '\0');
+    return fs::path(program).filename() == "RolvaneManager" ? std::optional(pid) : std::nullopt;
 }
 
 std::string UserWorld::write(const std::string& name, const std::string& contents) {

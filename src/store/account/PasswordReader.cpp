@@ -2,6 +2,7 @@
 
 #include "foundation/CXException.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <chrono>
 #include <cstring>
@@ -9,11 +10,14 @@
 #include <poll.h>
 #include <signal.h>
 #include <spawn.h>
+#include <string_view>
+#include <sys/prctl.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
+#include <vector>
 
-extern char** environ;
+extern char** environ; // NOLINT: POSIX declares it nowhere
 
 namespace rolvane {
 
@@ -21,6 +25,47 @@ namespace {
 
 constexpr size_t kMaxBytes = 4096;
 constexpr int kCommandSeconds = 10;
+
+// Variables that are this process's own affair, or that make the command's shell or its programs run something else.
+// Everything else stays: a password manager finds its session, agent and display there.
+constexpr std::string_view kNotForCommands[] = {
+    "LD_",       "GCONV_PATH=", "GLIBC_TUNABLES=", "NOTIFY_SOCKET=", "LISTEN_", "WATCHDOG_", "ENV=",
+    "BASH_ENV=", "BASH_FUNC_",  "SHELLOPTS=",      "BASHOPTS=",      "IFS=",    "CDPATH=",   "PS4="};
+
+// The directories of a path that mean the same wherever the command runs.
+std::string absolutePath(std::string_view path) {
+    std::string out;
+    while (!path.empty()) {
+        const size_t end = std::min(path.find(':'), path.size());
+        if (path[0] == '/') out += (out.empty() ? "" : ":") + std::string(path.substr(0, end));
+        path.remove_prefix(std::min(end + 1, path.size()));
+    }
+    return out.empty() ? "/usr/local/bin:/usr/bin:/bin" : out;
+}
+
+std::vector<std::string> environmentOfCommands() {
+    std::vector<std::string> all;
+    for (char** each = environ; *each; ++each) {
+        const std::string_view variable = *each;
+        if (std::any_of(std::begin(kNotForCommands), std::end(kNotForCommands),
+                        [&](std::string_view name) { return variable.starts_with(name); }))
+            continue;
+        if (constexpr std::string_view kPath = "PATH="; variable.starts_with(kPath))
+            all.push_back(std::string(kPath) + absolutePath(variable.substr(kPath.size())));
+        else
+            all.emplace_back(variable);
+    }
+    return all;
+}
+
+// Whoever asks for the password keeps it, and so does what sends it. A core file of this process would hold it.
+void keepOutOfCoreFiles() {
+    prctl(PR_SET_DUMPABLE, 0, 0, 0, 0);
+}
+
+void clear(std::string& text) {
+    explicit_bzero(text.data(), text.size());
+}
 
 [[noreturn]] void fail(const std::string& reason) {
     throw CXException(kCXNetworkException, reason);
@@ -47,7 +92,10 @@ std::string fromFile(const std::string& path, bool checkMode) {
     char buffer[kMaxBytes];
     const ssize_t n = read(file.fd, buffer, sizeof buffer);
     if (n < 0) fail("The password file " + path + " cannot be read: " + strerror(errno) + ".");
-    const std::string password = firstLine({buffer, static_cast<size_t>(n)});
+    std::string text(buffer, static_cast<size_t>(n));
+    const std::string password = firstLine(text);
+    clear(text);
+    explicit_bzero(buffer, sizeof buffer);
     if (password.empty()) fail("The password file " + path + " is empty.");
     return password;
 }
@@ -75,6 +123,7 @@ bool readAll(int fd, std::string& out) {
         const ssize_t n = read(fd, buffer, sizeof buffer);
         if (n <= 0) return true;
         out.append(buffer, static_cast<size_t>(n));
+        explicit_bzero(buffer, sizeof buffer);
         if (out.find('\n') != std::string::npos) return true;
     }
     return true;
@@ -109,16 +158,23 @@ std::string fromCommand(const std::string& command) {
     sigemptyset(&none);
     posix_spawnattr_setsigmask(&attributes, &none);
     posix_spawnattr_setflags(&attributes, POSIX_SPAWN_SETSIGMASK);
-    const int error = posix_spawn(&child, "/bin/sh", &actions, &attributes, const_cast<char**>(arguments), environ);
+    std::vector<std::string> environment = environmentOfCommands();
+    std::vector<char*> variables;
+    for (std::string& variable : environment) variables.push_back(variable.data());
+    variables.push_back(nullptr);
+    const int error =
+        posix_spawn(&child, "/bin/sh", &actions, &attributes, const_cast<char**>(arguments), variables.data());
     posix_spawnattr_destroy(&attributes);
     posix_spawn_file_actions_destroy(&actions);
     close(ends[1]);
     if (error != 0) fail(std::string("The password command cannot be started: ") + strerror(error) + ".");
     std::string output;
+    output.reserve(kMaxBytes + 512); // grows no copies
     const bool inTime = readAll(readEnd.fd, output);
     const int status = ended(child, inTime);
     if (!inTime) fail("The password command gave no answer within " + std::to_string(kCommandSeconds) + " seconds.");
     const std::string password = firstLine(output);
+    clear(output);
     if (password.empty())
         fail("The password command gave no password (exit code " +
              std::to_string(WIFEXITED(status) ? WEXITSTATUS(status) : -1) + "). Try it in a shell.");
@@ -128,6 +184,7 @@ std::string fromCommand(const std::string& command) {
 } // namespace
 
 std::string readPassword(const PasswordSource& source) {
+    if (source.kind != PasswordSource::Kind::none) keepOutOfCoreFiles();
     switch (source.kind) {
     case PasswordSource::Kind::none: return {};
     case PasswordSource::Kind::command: return fromCommand(source.value);

@@ -74,9 +74,8 @@ bool CXACE::canWrite() const {
 }
 
 bool CXACE::canWriteSomething() const {
-    return canWrite() || std::any_of(kWriteParts.begin(), kWriteParts.end(), [this](std::string_view part) {
-               return _privileges.contains(std::string(part));
-           });
+    return canWrite() || std::any_of(kWriteParts.begin(), kWriteParts.end(),
+                                     [this](std::string_view part) { return _privileges.contains(std::string(part)); });
 }
 
 bool CXACE::isPlain() const {
