@@ -178,8 +178,8 @@ TEST(Put, RefusesWhatIsNoCardAndChangesNothing) {
     const auto conflict = refused(fresh, cardOf(uid, "Ann", "Lee"), "no-uid-conflict", 409);
     EXPECT_THAT(conflict.body, HasSubstr("<D:href>" + path + "</D:href>"));
     refused(path, good, "no-uid-conflict", 409);
-    refused("/books/home/x.vcf", good, "addressbook-collection-location-ok");
-    refused("/books/home/nothing/x.vcf", good, "", 409);
+    refused("/books/home/x.vcf", good, "", 409);
+    refused("/books/home/nothing/x.vcf", good, "addressbook-collection-location-ok");
     EXPECT_EQ(world.ask("GET", fresh).status, 404);
 }
 
