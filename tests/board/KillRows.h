@@ -1,0 +1,10 @@
+#pragma once
+
+#include "Board.h"
+
+namespace rolvane::board {
+
+void killEverywhere(Work& work);
+void killTwice(Work& work);
+
+} // namespace rolvane::board
