@@ -12,9 +12,8 @@ CurlTransportOptions trusting(const std::string& caFile) {
 
 } // namespace
 
-FaultyStore::FaultyStore(CommandWorld& world)
-    : _upstream(trusting(world.store().caFile())), _origin(world.store().baseURL()),
-      _secure(world.store().endpointTemplate()), _server([this](const FakeRequest& request) {
+FaultyStore::FaultyStore(PrivateStore& store)
+    : _upstream(trusting(store.caFile())), _origin(store.baseURL()), _secure(store.endpointTemplate()), _server([this](const FakeRequest& request) {
           Fault fault;
           {
               const std::lock_guard guard(_lock);

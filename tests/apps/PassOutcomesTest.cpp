@@ -59,7 +59,7 @@ protected:
 
 TEST_F(Outcomes, ASyncOfASubscriberSaysWhyTheStoreWasNotReached) {
     world.done({"publish"});
-    FaultyStore faulty(world);
+    FaultyStore faulty(world.store());
     Neighbour bob(world, "bob");
     world.done({"share", "bob"});
     bob.done(faulty.account());

@@ -21,6 +21,7 @@ struct Work {
     Count& count;
     size_t job = 0, jobs = 1; // this one's number, and how many share the row
     size_t every = 1;         // only each so many-th case
+    bool goesOn = true;       // people edit on between the fault and the clean passes
     std::function<bool()> timeIsOver;
     // Tells of a case that went wrong.
     std::function<void(const std::string& name, const std::vector<std::string>& wrong)> failed;
@@ -51,7 +52,7 @@ void makeScenarios(Stage& stage);
 Settling settlingOf(const Scenario& scenario);
 
 // After the fault, before the clean passes: nobody does anything, or who was harmed edits on, or somebody else does.
-void goOn(Stage& stage, const Scenario& scenario, size_t number);
+void goOn(Work& work, const Scenario& scenario, size_t number);
 
 // Ends a case, in which the harmed process ended so: true when nothing is wrong.
 bool judge(Work& work, const std::string& name, const Settling& settling, const Ending& harmed);

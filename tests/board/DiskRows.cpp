@@ -36,7 +36,7 @@ void breakDisk(Work& work) {
                 fault.at = static_cast<int64_t>(operation);
                 const Ending ending = work.stage.pass(scenario.role, fault);
                 if (ending.met == 0) break; // the pass has fewer
-                goOn(work.stage, scenario, operation);
+                goOn(work, scenario, operation);
                 judge(work, scenario.name + ", " + kDisks[disk].name + " at " + std::to_string(operation),
                       settlingOf(scenario), ending);
             }

@@ -26,7 +26,7 @@ void killEverywhere(Work& work) {
             work.stage.bringBack(scenario.name);
             const Ending ending = work.stage.pass(scenario.role, killAt(static_cast<int64_t>(operation)));
             if (ending.met == 0) break; // the pass has fewer
-            goOn(work.stage, scenario, operation);
+            goOn(work, scenario, operation);
             judge(work, scenario.name + " killed at " + std::to_string(operation), settlingOf(scenario), ending);
         }
 }
@@ -47,10 +47,10 @@ void killTwice(Work& work) {
         stage.bringBack(scenario.name);
         const auto first = static_cast<int64_t>(chance.below(static_cast<size_t>(whole)));
         (void)stage.pass(scenario.role, killAt(first));
-        if (chance.happens(0.3)) goOn(stage, scenario, number);
+        if (chance.happens(0.3)) goOn(work, scenario, number);
         const auto second = static_cast<int64_t>(chance.below(static_cast<size_t>(whole)));
         const Ending ending = stage.pass(scenario.role, killAt(second));
-        goOn(stage, scenario, number + kPairs);
+        goOn(work, scenario, number + kPairs);
         judge(work, scenario.name + " killed at " + std::to_string(first) + " and at " + std::to_string(second),
               settlingOf(scenario), ending);
     }

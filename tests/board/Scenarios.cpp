@@ -69,7 +69,9 @@ Settling settlingOf(const Scenario& scenario) {
     return settling;
 }
 
-void goOn(Stage& stage, const Scenario& scenario, size_t number) {
+void goOn(Work& work, const Scenario& scenario, size_t number) {
+    if (!work.goesOn) return;
+    Stage& stage = work.stage;
     const char harmed = scenario.role, itself = harmed == 'r' ? 'o' : harmed, other = harmed == 'o' ? 'w' : 'o';
     const std::string stamp = "n" + std::to_string(number);
     switch (worlds::hashOf("go on " + scenario.name, stage.seed() * 1000 + number) % 4) {

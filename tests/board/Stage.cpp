@@ -44,7 +44,9 @@ void shell(const std::string& command) {
 } // namespace
 
 Stage::Stage(PrivateStore& store, std::string shim, uint64_t seed)
-    : _store(store), _shim(std::move(shim)), _seed(seed), _suffix([] {
+    : _store(store), _entrance(store),
+      _tls(_entrance.port(), store.stateDirectory() + "/tls/server.pem", store.stateDirectory() + "/tls/server.key"),
+      _shim(std::move(shim)), _seed(seed), _suffix([] {
           static int serial = 0; // one tree is never used for two stages
           return std::to_string(++serial);
       }()) {
@@ -77,8 +79,9 @@ void Stage::begin() {
             fs::permissions(home(role) + "/" + directory, fs::perms::owner_all);
         }
         _store.addUser(userOf(role), _password);
+        const std::string endpoint = "https://localhost:" + std::to_string(_tls.port()) + "/dav/{user}/Contacts";
         const Ending set = command(role,
-                                   {"account", "set", "--user", userOf(role), "--endpoint", _store.endpointTemplate(),
+                                   {"account", "set", "--user", userOf(role), "--endpoint", endpoint,
                                     "--ca-file", _store.caFile(), "--host", kHost, "--ask-password"},
                                    {}, _password + "\n");
         if (set.status != 0) fail("no account: " + set.log);

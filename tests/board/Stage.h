@@ -1,9 +1,11 @@
 #pragma once
 
+#include "../apps/FaultyStore.h"
 #include "../worlds/Chance.h"
 #include "../worlds/Editor.h"
 #include "../worlds/Model.h"
 #include "FaultControl.h"
+#include "TlsEntrance.h"
 #include "foundation/Url.h"
 #include "server/PrivateStore.h"
 #include "support/TempHome.h"
@@ -68,6 +70,8 @@ public:
     void tell(const std::string& line) { _story += line + "\n"; }
     const std::string& story() const { return _story; }
     void forgetStory() { _story.clear(); }
+    // Every request of the three goes through it.
+    test::FaultyStore& entrance() { return _entrance; }
     uint64_t seed() const { return _seed; }
     worlds::Model& model() { return _model; }
 
@@ -77,6 +81,8 @@ private:
     void begin();
 
     PrivateStore& _store;
+    test::FaultyStore _entrance;
+    TlsEntrance _tls;
     const std::string _shim;
     const uint64_t _seed;
     const std::string _suffix;

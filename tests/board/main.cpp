@@ -3,6 +3,7 @@
 #include "Board.h"
 #include "DiskRows.h"
 #include "KillRows.h"
+#include "RequestRows.h"
 #include "Table.h"
 #include "foundation/CXException.h"
 
@@ -25,6 +26,9 @@ const std::vector<Row>& rows() {
         {"kill", "SIGKILL at every durable operation of a pass, and behind every answer", killEverywhere},
         {"twice", "a second SIGKILL, in the pass that recovers", killTwice},
         {"disk", "a full, a failing, a read-only disk at every change of a file, once and from then on", breakDisk},
+        {"request", "each request of a pass answered by 500, 503, 429, 401, 403, 404, 409, 412, 423, 507, a portal or half a "
+                    "document, cut, reset, not at all, or lost behind its deed",
+         spoilRequests},
     };
     return all;
 }
@@ -32,7 +36,7 @@ const std::vector<Row>& rows() {
 namespace {
 
 constexpr const char* kUsage = R"(usage: board [--seeds LIST] [--rows NAME,...] [--jobs N] [--every N]
-             [--seconds N] [--keep DIRECTORY] [--table FILE]
+             [--seconds N] [--alone] [--keep DIRECTORY] [--table FILE]
 
 Each row is a kind of fault. A case lets it strike an owner, a writer or a reader at one place, lets everybody make two
 clean passes, and compares the three copies and the store with one another and with what was done. Exit status 1 when
@@ -43,6 +47,7 @@ anything is wrong.
   --jobs     how many processes work on it (1)
   --every    only each so many-th case (1)
   --seconds  ends after about so long; the rows that were cut off say so
+  --alone    nobody edits between the fault and the clean passes; else who was harmed goes on, or somebody else, or nobody
   --keep     where the story of each case that went wrong is put
   --table    the Markdown file whose table, between two marks, is replaced by this run's
 )";
@@ -51,6 +56,7 @@ struct Arguments {
     std::vector<uint64_t> seeds{1};
     std::vector<Row> rows;
     size_t jobs = 1, every = 1, seconds = 0;
+    bool goesOn = true;
     std::string keep, table;
 };
 
@@ -81,6 +87,10 @@ Arguments argumentsOf(int argc, char** argv) {
         if (name == "--help") {
             std::cout << kUsage;
             std::exit(0);
+        }
+        if (name == "--alone") {
+            a.goesOn = false;
+            continue;
         }
         if (i + 1 == argc) misuse(name + " needs a value");
         const std::string value = argv[++i];
@@ -141,7 +151,7 @@ void work(const Arguments& arguments, Count* counts, size_t job) {
             const Row& row = arguments.rows[i];
             Count& count = counts[i];
             const auto share = Clock::now() + (end - Clock::now()) / static_cast<int64_t>(left);
-            Work todo{stage, count, job, arguments.jobs, arguments.every, nullptr, nullptr};
+            Work todo{stage, count, job, arguments.jobs, arguments.every, arguments.goesOn, nullptr, nullptr};
             todo.timeIsOver = [&] {
                 const bool over = arguments.seconds > 0 && Clock::now() > share;
                 if (over) count.cut = true;

@@ -20,6 +20,7 @@
 #include <sys/syscall.h>
 #include <sys/time.h>
 #include <sys/uio.h>
+#include <time.h>
 #include <unistd.h>
 
 namespace {
@@ -346,7 +347,17 @@ ssize_t sendmsg(int fd, const msghdr* message, int flags) {
     return sending(fd, [&] { return real(fd, message, flags); });
 }
 
-// The clock. `time` is left alone: certificates are judged by it.
+// The clock. Certificates are judged by `time`, which therefore goes along for a day at most.
+time_t time(time_t* where) noexcept {
+    constexpr int64_t kDay = 86400;
+    timespec now{};
+    static const auto real = next(&::clock_gettime, "clock_gettime");
+    real(CLOCK_REALTIME, &now);
+    const int64_t later = secondsLater();
+    if (later < kDay && later > -kDay) now.tv_sec += later;
+    if (where) *where = now.tv_sec;
+    return now.tv_sec;
+}
 int clock_gettime(clockid_t clock, timespec* now) noexcept {
     REAL(clock_gettime);
     const int result = real(clock, now);
