@@ -10,12 +10,13 @@ TESTS  ?=
 CTEST   = ctest -j$(JOBS) --no-tests=error --output-on-failure $(if $(TESTS),-R '$(TESTS)')
 
 .DEFAULT_GOAL := help
-.PHONY: help setup build demo test worlds interop asan tsan fuzz bench lint format install install-symbols deb clean
+.PHONY: help setup build demo test worlds board interop asan tsan fuzz bench lint format install install-symbols deb clean
 
 help:
 	@echo 'make demo              set up, build, and show the main job on a private store'
 	@echo 'make test              set up, build (release) and run every test; TESTS=regex runs some'
 	@echo 'make worlds            three people, faults, kills and full disks (docs/reliability.md); SEEDS=1..20'
+	@echo 'make board             every fault at every place, judged; writes docs/reliability.md; BOARD_SECONDS=600, BOARD_SEEDS=1,2,3'
 	@echo 'make interop           the whole cycle on the WebDAV servers of others; writes docs/servers.md'
 	@echo 'make asan, make tsan   the same tests under AddressSanitizer+UBSan, or ThreadSanitizer'
 	@echo 'make fuzz              every fuzz target for SECONDS_EACH seconds (60)'
@@ -44,6 +45,11 @@ test: build
 SEEDS ?= 1..20
 worlds: build
 	build/release/tests/worlds --seeds $(SEEDS) --jobs $(JOBS)
+
+BOARD_SEEDS ?= 1
+BOARD_SECONDS ?= 0
+board: build
+	build/release/tests/board --seeds $(BOARD_SEEDS) --seconds $(BOARD_SECONDS) --jobs $(JOBS) --table docs/reliability.md
 
 interop: build
 	@packaging/setup build test interop

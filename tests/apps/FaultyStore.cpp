@@ -13,7 +13,8 @@ CurlTransportOptions trusting(const std::string& caFile) {
 } // namespace
 
 FaultyStore::FaultyStore(PrivateStore& store)
-    : _upstream(trusting(store.caFile())), _origin(store.baseURL()), _secure(store.endpointTemplate()), _server([this](const FakeRequest& request) {
+    : _upstream(trusting(store.caFile())), _origin(store.baseURL()), _secure(store.endpointTemplate()),
+      _server([this](const FakeRequest& request) {
           Fault fault;
           {
               const std::lock_guard guard(_lock);

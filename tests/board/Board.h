@@ -27,15 +27,14 @@ struct Work {
     std::function<void(const std::string& name, const std::vector<std::string>& wrong)> failed;
 
     // True when the case with that number is this process's.
-    bool isMine(size_t number) const {
-        return number % every == stage.seed() % every && number / every % jobs == job;
-    }
+    bool isMine(size_t number) const { return number % every == stage.seed() % every && number / every % jobs == job; }
 };
 
 struct Row {
     std::string name;  // for --rows
     std::string fault; // as the table calls it
     void (*run)(Work& work);
+    bool usesEntrance = false; // requests go through an entrance that can spoil them, which costs time
 };
 
 const std::vector<Row>& rows();

@@ -6,9 +6,9 @@
 namespace rolvane::board {
 
 // A page that the board shares with the processes that it harms: the board says which operation meets a fault, and the
-// library that is loaded into those processes (shim/Shim.cpp) counts their operations. Its file is named by the variable
-// kControlVariable. An operation is a call that changes a file below `root`, or with `network` one that sends bytes to a
-// server; the moment after the server has answered counts as one more.
+// library that is loaded into those processes (shim/Shim.cpp) counts their operations. Its file is named by the
+// variable kControlVariable. An operation is a call that changes a file below `root`, or with `network` one that sends
+// bytes to a server; the moment after the server has answered counts as one more.
 struct FaultControl {
     enum Kind : int32_t { none, kill, fullDisk, failingDisk, readOnlyDisk };
     char root[256];

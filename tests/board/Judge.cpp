@@ -108,7 +108,7 @@ Verdict settleAndJudge(Stage& stage, const Settling& settling) {
     verdict.wrong = differing;
     verdict.wrong.insert(verdict.wrong.end(), unclean.begin(), unclean.end());
     addAll(verdict.wrong, "not at rest", stage.writesToTheStore());
-    addAll(verdict.wrong, "store", stage.locksOnTheStore());
+    addAll(verdict.wrong, "a lock is left on the clock file", stage.locksOnTheStore());
     for (const char* role = Stage::kRoles; *role; ++role)
         addAll(verdict.wrong, nameOf(*role), leftIn(stage.home(*role)));
     for (const std::string& each : verdict.wrong) stage.tell("!! " + each);

@@ -11,9 +11,9 @@ namespace {
 using test::FakeAnswer;
 using test::FakeRequest;
 
-constexpr std::array kKinds{"500",  "503",       "503 for a second", "429",   "401",           "403",         "404",
-                            "409",  "412",       "423",              "507",   "reset",         "lost answer", "cut body",
-                            "half", "portal page", "hang"};
+constexpr std::array kKinds{
+    "500", "503",   "503 for a second", "429",      "401",  "403",         "404", "409", "412", "423",
+    "507", "reset", "lost answer",      "cut body", "half", "portal page", "hang"};
 // The last kind takes the twenty seconds until a client gives up, and comes at each so many-th request.
 constexpr size_t kHangs = 12;
 constexpr size_t kMostRequests = 2000;
@@ -96,7 +96,8 @@ bool spoil(Work& work, const Scenario& scenario, size_t request, const std::stri
     Settling settling = settlingOf(scenario);
     constexpr int64_t kAnHour = 3600; // what a store has refused rests for half an hour at most
     settling.later = kAnHour;
-    judge(work, scenario.name + ", " + kind + " at request " + std::to_string(request) + " " + met.substr(0, met.find(' ')),
+    judge(work,
+          scenario.name + ", " + kind + " at request " + std::to_string(request) + " " + met.substr(0, met.find(' ')),
           settling, ending);
     return true;
 }

@@ -27,8 +27,9 @@ worlds::Habits takingBack() {
 } // namespace
 
 const std::vector<Scenario>& scenarios() {
-    static const std::vector<Scenario> all{{"owner-first", 'o', true},  {"writer-first", 'w', false}, {"reader-first", 'r', false},
-                                           {"owner-later", 'o', false}, {"writer-later", 'w', false}, {"reader-later", 'r', false}};
+    static const std::vector<Scenario> all{{"owner-first", 'o', true},   {"writer-first", 'w', false},
+                                           {"reader-first", 'r', false}, {"owner-later", 'o', false},
+                                           {"writer-later", 'w', false}, {"reader-later", 'r', false}};
     return all;
 }
 

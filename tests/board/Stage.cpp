@@ -3,7 +3,6 @@
 #include "../worlds/Report.h"
 #include "../worlds/StoreView.h"
 #include "foundation/CXException.h"
-#include "store/http/HttpTransport.h"
 #include "support/ChildProcess.h"
 #include "support/UserWorld.h"
 
@@ -43,13 +42,16 @@ void shell(const std::string& command) {
 
 } // namespace
 
-Stage::Stage(PrivateStore& store, std::string shim, uint64_t seed)
-    : _store(store), _entrance(store),
-      _tls(_entrance.port(), store.stateDirectory() + "/tls/server.pem", store.stateDirectory() + "/tls/server.key"),
-      _shim(std::move(shim)), _seed(seed), _suffix([] {
+Stage::Stage(PrivateStore& store, std::string shim, uint64_t seed, bool withEntrance)
+    : _store(store), _shim(std::move(shim)), _seed(seed), _suffix([] {
           static int serial = 0; // one tree is never used for two stages
           return std::to_string(++serial);
       }()) {
+    if (withEntrance) {
+        _entrance = std::make_unique<test::FaultyStore>(store);
+        _tls = std::make_unique<TlsEntrance>(_entrance->port(), store.stateDirectory() + "/tls/server.pem",
+                                             store.stateDirectory() + "/tls/server.key");
+    }
     const std::string path = _directory / "control";
     const int fd = ::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
     if (fd < 0 || ::ftruncate(fd, sizeof(FaultControl)) != 0) fail("no file for the control");
@@ -79,15 +81,17 @@ void Stage::begin() {
             fs::permissions(home(role) + "/" + directory, fs::perms::owner_all);
         }
         _store.addUser(userOf(role), _password);
-        const std::string endpoint = "https://localhost:" + std::to_string(_tls.port()) + "/dav/{user}/Contacts";
+        const std::string endpoint = _tls ? "https://localhost:" + std::to_string(_tls->port()) + "/dav/{user}/Contacts"
+                                          : _store.endpointTemplate();
         const Ending set = command(role,
-                                   {"account", "set", "--user", userOf(role), "--endpoint", endpoint,
-                                    "--ca-file", _store.caFile(), "--host", kHost, "--ask-password"},
+                                   {"account", "set", "--user", userOf(role), "--endpoint", endpoint, "--ca-file",
+                                    _store.caFile(), "--host", kHost, "--ask-password"},
                                    {}, _password + "\n");
         if (set.status != 0) fail("no account: " + set.log);
         (void)command(role, {"defaults", "write", "CXDDebugLevel", "1"});
     }
-    edit('o', [](Editor& editor) { editor.makeAtFirst(5, 3); }, "0");
+    edit(
+        'o', [](Editor& editor) { editor.makeAtFirst(5, 3); }, "0");
     for (const std::vector<std::string>& line : {std::vector<std::string>{"publish", "--no-daemon"},
                                                  {"share", userOf('r'), "--no-daemon"},
                                                  {"share", userOf('w'), "--write", "--no-daemon"}})
@@ -99,12 +103,9 @@ RemoteLocation Stage::locationFor(char role) const {
 }
 
 std::vector<std::string> Stage::environmentOf(char role) const {
-    std::vector<std::string> all{"HOME=" + home(role),
-                                 "PATH=/usr/bin:/bin",
-                                 "LANG=C.UTF-8",
-                                 "ROLVANE_MANAGER=" + test::UserWorld::managerProgram(),
-                                 "LD_PRELOAD=" + _shim,
-                                 std::string(kControlVariable) + "=" + _directory / "control"};
+    std::vector<std::string> all{"HOME=" + home(role),  "PATH=/usr/bin:/bin",
+                                 "LANG=C.UTF-8",        "ROLVANE_MANAGER=" + test::UserWorld::managerProgram(),
+                                 "LD_PRELOAD=" + _shim, std::string(kControlVariable) + "=" + _directory / "control"};
     for (const auto& [variable, directory] : kDirectories)
         all.push_back(std::string(variable) + "=" + home(role) + "/" + directory);
     if (const char* temporary = std::getenv("TMPDIR")) all.push_back(std::string("TMPDIR=") + temporary);
@@ -124,7 +125,8 @@ Ending Stage::run(char role, std::vector<std::string> arguments, const Fault& fa
     c.count = c.met = 0;
 
     std::string line = std::string(1, role) + ":";
-    for (size_t i = 0; i < arguments.size(); ++i) line += " " + (i > 0 ? arguments[i] : fs::path(arguments[0]).filename().string());
+    for (size_t i = 0; i < arguments.size(); ++i)
+        line += " " + (i > 0 ? arguments[i] : fs::path(arguments[0]).filename().string());
     test::ChildProcess child({.arguments = std::move(arguments), .environment = environmentOf(role), .input = input});
     if (input.empty()) child.closeInput();
     const auto ended = child.wait(kPatience);
@@ -141,7 +143,8 @@ Ending Stage::run(char role, std::vector<std::string> arguments, const Fault& fa
     ending.log = child.errors();
     tell("== " + line);
     if (ending.met > 0)
-        tell("   FAULT at operation " + std::to_string(fault.at) + ", " + std::to_string(ending.met) + " met: " + ending.where);
+        tell("   FAULT at operation " + std::to_string(fault.at) + ", " + std::to_string(ending.met) +
+             " met: " + ending.where);
     tell(ending.output + ending.log);
     return ending;
 }
@@ -156,7 +159,8 @@ Ending Stage::command(char role, std::vector<std::string> arguments, const Fault
 }
 
 void Stage::edit(char role, const Habits& habits, const std::string& stamp) {
-    edit(role, [&](Editor& editor) { editor.edit(habits); }, stamp);
+    edit(
+        role, [&](Editor& editor) { editor.edit(habits); }, stamp);
 }
 
 void Stage::edit(char role, const std::function<void(Editor&)>& work, const std::string& stamp) {
@@ -187,11 +191,21 @@ void Stage::keep(const std::string& name) {
 void Stage::bringBack(const std::string& name) {
     const std::string kept = _directory / ("kept/" + name), tree = _store.userDirectory(userOf('o')),
                       lists = _store.stateDirectory() + "/lists";
-    shell("rm -rf " + home('o') + " " + home('w') + " " + home('r') + " " + tree + "/Contacts " + lists + "/*.acl && cp -a " + kept + "/o " +
-          kept + "/w " + kept + "/r " + _directory.path() + " && cp -a " + kept + "/tree/. " + tree + "/ && cp -a " +
-          kept + "/lists/. " + lists + "/");
+    shell("rm -rf " + home('o') + " " + home('w') + " " + home('r') + " " + tree + "/Contacts " + lists +
+          "/*.acl && cp -a " + kept + "/o " + kept + "/w " + kept + "/r " + _directory.path() + " && cp -a " + kept +
+          "/tree/. " + tree + "/ && cp -a " + kept + "/lists/. " + lists + "/");
     _model = _keptModels.at(name);
     (void)writesToTheStore();
+}
+
+void Stage::bringBackHome(const std::string& name, char role) {
+    shell("rm -rf " + home(role) + " && cp -a " + kept(name, role) + " " + home(role));
+}
+
+std::string Stage::scratch(const std::string& name) const {
+    std::string path = _directory / name;
+    fs::remove(path);
+    return path;
 }
 
 View Stage::view(char role) const {
@@ -226,23 +240,38 @@ std::vector<std::string> Stage::writesToTheStore() {
     return writes;
 }
 
-std::vector<std::string> Stage::locksOnTheStore() const {
+HttpResponse Stage::ask(char role, const std::string& method, std::vector<std::pair<std::string, std::string>> headers,
+                        const std::string& body) const {
     CurlTransportOptions options;
     options.caFile = _store.caFile();
     CurlTransport transport(options);
-    const Url base = Url(_store.baseURL() + "/" + userOf('o') + "/Contacts");
-    transport.setCredentials(
-        TransportCredentials{userOf('o'), _password, {base.origin()}, TransportCredentials::Scheme::basic});
     HttpRequest request;
-    request.method = "PROPFIND";
-    request.url = Url(base.absoluteString() + "/dateFile");
-    request.headers = {{"Depth", "0"}, {"Content-Type", "application/xml"}};
-    request.body = std::make_shared<const std::string>(
-        "<?xml version=\"1.0\"?><propfind xmlns=\"DAV:\"><prop><lockdiscovery/></prop></propfind>");
-    const HttpResponse answer = transport.perform(std::move(request));
-    if (!answer.complete() || answer.status != 207) return {"the clock file's locks cannot be asked for"};
-    if (answer.body.find("locktoken") != std::string::npos) return {"the clock file is locked"};
-    return {};
+    request.method = method;
+    request.url = Url(_store.baseURL() + "/" + userOf('o') + "/Contacts/dateFile");
+    request.headers = std::move(headers);
+    if (!body.empty()) request.body = std::make_shared<const std::string>(body);
+    transport.setCredentials(
+        TransportCredentials{userOf(role), _password, {request.url.origin()}, TransportCredentials::Scheme::basic});
+    return transport.perform(std::move(request));
+}
+
+std::vector<std::string> Stage::locksOnTheStore() const {
+    const HttpResponse answer =
+        ask('o', "PROPFIND", {{"Depth", "0"}, {"Content-Type", "application/xml"}},
+            "<?xml version=\"1.0\"?><propfind xmlns=\"DAV:\"><prop><lockdiscovery/></prop></propfind>");
+    if (!answer.complete() || answer.status != 207) return {"unknown, as the store does not say"};
+    std::vector<std::string> tokens;
+    const std::string scheme = "opaquelocktoken:";
+    for (size_t at = 0; (at = answer.body.find(scheme, at)) != std::string::npos; at += scheme.size())
+        tokens.push_back(answer.body.substr(at, answer.body.find('<', at) - at));
+    return tokens;
+}
+
+void Stage::expireLocks() {
+    for (const std::string& token : locksOnTheStore())
+        for (const char* role = kRoles; *role; ++role)
+            if (ask(*role, "UNLOCK", {{"Lock-Token", "<" + token + ">"}}, {}).status == 204)
+                tell("the lock of " + std::string(1, *role) + " runs out");
 }
 
 } // namespace rolvane::board

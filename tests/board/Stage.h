@@ -8,10 +8,12 @@
 #include "TlsEntrance.h"
 #include "foundation/Url.h"
 #include "server/PrivateStore.h"
+#include "store/http/HttpTransport.h"
 #include "support/TempHome.h"
 
 #include <functional>
 #include <map>
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -41,8 +43,8 @@ struct Ending {
 class Stage {
 public:
     static constexpr const char* kRoles = "owr";
-    // Programs are run with the library at `shim`.
-    Stage(PrivateStore& store, std::string shim, uint64_t seed);
+    // Programs are run with the library at `shim`. With an entrance every request of the three goes through it.
+    Stage(PrivateStore& store, std::string shim, uint64_t seed, bool withEntrance);
     ~Stage();
     Stage(const Stage&) = delete;
     Stage& operator=(const Stage&) = delete;
@@ -56,12 +58,19 @@ public:
     // Everything that people and store hold, under a name; and back to it, as if nothing had happened since.
     void keep(const std::string& name);
     void bringBack(const std::string& name);
+    void bringBackHome(const std::string& name, char role); // that person's files alone
+    std::string kept(const std::string& name, char role) const {
+        return _directory / ("kept/" + name + "/" + std::string(1, role));
+    }
+    // An empty place for a file, of that name.
+    std::string scratch(const std::string& name) const;
 
     worlds::View view(char role) const;
     worlds::View storeView() const;
     // Methods and paths of requests that changed the store, and went well, since the last call.
     std::vector<std::string> writesToTheStore();
-    std::vector<std::string> locksOnTheStore() const;
+    std::vector<std::string> locksOnTheStore() const; // tokens of those on the clock file
+    void expireLocks();                               // as five minutes do
     std::string home(char role) const { return _directory / std::string(1, role); }
     std::string databaseOf(char role) const { return home(role) + "/data/rolvane/contacts.db"; }
     std::string userOf(char role) const { return role + _suffix; }
@@ -70,19 +79,20 @@ public:
     void tell(const std::string& line) { _story += line + "\n"; }
     const std::string& story() const { return _story; }
     void forgetStory() { _story.clear(); }
-    // Every request of the three goes through it.
-    test::FaultyStore& entrance() { return _entrance; }
+    test::FaultyStore& entrance() { return *_entrance; }
     uint64_t seed() const { return _seed; }
     worlds::Model& model() { return _model; }
 
 private:
     Ending run(char role, std::vector<std::string> arguments, const Fault& fault, const std::string& input);
+    HttpResponse ask(char role, const std::string& method, std::vector<std::pair<std::string, std::string>> headers,
+                     const std::string& body) const; // about the clock file
     std::vector<std::string> environmentOf(char role) const;
     void begin();
 
     PrivateStore& _store;
-    test::FaultyStore _entrance;
-    TlsEntrance _tls;
+    std::unique_ptr<test::FaultyStore> _entrance;
+    std::unique_ptr<TlsEntrance> _tls;
     const std::string _shim;
     const uint64_t _seed;
     const std::string _suffix;

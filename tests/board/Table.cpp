@@ -12,7 +12,8 @@ namespace {
 
 constexpr const char* kBegin = "<!-- the board -->\n";
 constexpr const char* kEnd = "<!-- end of the board -->\n";
-constexpr const char* kHead = "| row | fault | cases | failures | late | seeds | when |\n|---|---|---|---|---|---|---|\n";
+constexpr const char* kHead =
+    "| row | fault | cases | failures | late | seeds | when |\n|---|---|---|---|---|---|---|\n";
 
 std::string today() {
     const std::time_t now = std::time(nullptr);
@@ -27,7 +28,8 @@ std::string lineOf(const TableRow& row) {
     std::string seeds;
     for (const uint64_t seed : row.seeds) seeds += (seeds.empty() ? "" : ", ") + std::to_string(seed);
     return "| " + row.name + " | " + row.fault + " | " + std::to_string(row.cases) + (row.part ? ", a part" : "") +
-           " | " + std::to_string(row.failures) + " | " + std::to_string(row.late) + " | " + seeds + " | " + today() + " |\n";
+           " | " + std::to_string(row.failures) + " | " + std::to_string(row.late) + " | " + seeds + " | " + today() +
+           " |\n";
 }
 
 } // namespace

@@ -4,6 +4,7 @@
 
 #include <algorithm>
 #include <arpa/inet.h>
+#include <csignal>
 #include <netinet/in.h>
 #include <openssl/ssl.h>
 #include <poll.h>
@@ -81,6 +82,10 @@ TlsEntrance::~TlsEntrance() {
 }
 
 void TlsEntrance::accept() {
+    sigset_t pipes; // a client that was killed; this thread's connections have the mask, too
+    sigemptyset(&pipes);
+    sigaddset(&pipes, SIGPIPE);
+    ::pthread_sigmask(SIG_BLOCK, &pipes, nullptr);
     while (!_ending) {
         const int fd = ::accept4(_listener, nullptr, nullptr, SOCK_CLOEXEC);
         if (fd < 0) return;

@@ -3,6 +3,7 @@
 #include "Board.h"
 #include "DiskRows.h"
 #include "KillRows.h"
+#include "PowerRows.h"
 #include "RequestRows.h"
 #include "Table.h"
 #include "foundation/CXException.h"
@@ -13,6 +14,7 @@
 #include <cstdlib>
 #include <fstream>
 #include <iostream>
+#include <memory>
 #include <new>
 #include <sstream>
 #include <sys/mman.h>
@@ -26,9 +28,11 @@ const std::vector<Row>& rows() {
         {"kill", "SIGKILL at every durable operation of a pass, and behind every answer", killEverywhere},
         {"twice", "a second SIGKILL, in the pass that recovers", killTwice},
         {"disk", "a full, a failing, a read-only disk at every change of a file, once and from then on", breakDisk},
-        {"request", "each request of a pass answered by 500, 503, 429, 401, 403, 404, 409, 412, 423, 507, a portal or half a "
-                    "document, cut, reset, not at all, or lost behind its deed",
-         spoilRequests},
+        {"power", "power lost: what was synced is there, later writes in part, later names up to a moment", losePower},
+        {"request",
+         "each request of a pass answered by 500, 503, 429, 401, 403, 404, 409, 412, 423, 507, a portal or half a "
+         "document, cut, reset, not at all, or lost behind its deed",
+         spoilRequests, true},
     };
     return all;
 }
@@ -99,9 +103,8 @@ Arguments argumentsOf(int argc, char** argv) {
             for (const std::string& each : listOf(value)) a.seeds.push_back(numberOf(each));
         } else if (name == "--rows") {
             const std::vector<std::string> names = listOf(value);
-            std::erase_if(a.rows, [&](const Row& row) {
-                return std::find(names.begin(), names.end(), row.name) == names.end();
-            });
+            std::erase_if(
+                a.rows, [&](const Row& row) { return std::find(names.begin(), names.end(), row.name) == names.end(); });
             if (a.rows.size() != names.size()) misuse("there is no such row among " + value);
         } else if (name == "--jobs") {
             a.jobs = std::max<size_t>(1, numberOf(value));
@@ -145,15 +148,21 @@ void work(const Arguments& arguments, Count* counts, size_t job) {
     const auto end = Clock::now() + std::chrono::seconds(arguments.seconds);
     size_t left = arguments.seeds.size() * arguments.rows.size();
     for (const uint64_t seed : arguments.seeds) {
-        Stage stage(store, ROLVANE_BOARD_SHIM, seed);
-        makeScenarios(stage);
+        std::unique_ptr<Stage> stage;
+        bool entrance = false;
         for (size_t i = 0; i < arguments.rows.size(); ++i, --left) {
             const Row& row = arguments.rows[i];
+            if (!stage || entrance != row.usesEntrance) {
+                entrance = row.usesEntrance;
+                stage = nullptr;
+                stage = std::make_unique<Stage>(store, ROLVANE_BOARD_SHIM, seed, entrance);
+                makeScenarios(*stage);
+            }
             Count& count = counts[i];
             const auto share = Clock::now() + (end - Clock::now()) / static_cast<int64_t>(left);
-            Work todo{stage, count, job, arguments.jobs, arguments.every, arguments.goesOn, nullptr, nullptr};
+            Work todo{*stage, count, job, arguments.jobs, arguments.every, arguments.goesOn, nullptr, nullptr};
             todo.timeIsOver = [&] {
-                const bool over = arguments.seconds > 0 && Clock::now() > share;
+                const bool over = arguments.seconds > 0 && count.cases > 0 && Clock::now() > share;
                 if (over) count.cut = true;
                 return over;
             };
@@ -163,7 +172,7 @@ void work(const Arguments& arguments, Count* counts, size_t job) {
                 for (size_t line = 0; line < std::min(wrong.size(), kMost); ++line) text += "    " + wrong[line] + "\n";
                 if (wrong.size() > kMost) text += "    and " + std::to_string(wrong.size() - kMost) + " more\n";
                 print(text);
-                keepStory(arguments, stage, row.name, name);
+                keepStory(arguments, *stage, row.name, name);
             };
             row.run(todo);
         }
@@ -189,11 +198,15 @@ int run(const Arguments& arguments) {
             ::_exit(status);
         }
     bool failed = false;
-    for (int status = 0; ::wait(&status) > 0;) failed |= !WIFEXITED(status) || WEXITSTATUS(status) != 0;
+    for (int status = 0; ::wait(&status) > 0;) {
+        if (WIFEXITED(status) && WEXITSTATUS(status) == 0) continue;
+        print("board: one of its processes did not come to its end\n");
+        failed = true;
+    }
     std::vector<TableRow> table;
     for (size_t i = 0; i < arguments.rows.size(); ++i) {
-        table.push_back({arguments.rows[i].name, arguments.rows[i].fault, counts[i].cases, counts[i].failures, counts[i].late,
-                         arguments.seeds, arguments.every > 1 || counts[i].cut});
+        table.push_back({arguments.rows[i].name, arguments.rows[i].fault, counts[i].cases, counts[i].failures,
+                         counts[i].late, arguments.seeds, arguments.every > 1 || counts[i].cut});
         failed |= counts[i].failures > 0 || counts[i].cases == 0;
     }
     print(textOf(table));

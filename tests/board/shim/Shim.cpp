@@ -118,11 +118,10 @@ void record(RecordedChange::What what, const char* path, const char* other = "",
     static const int file = ::open(c->record, O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0600);
     RecordedChange change{what, static_cast<int32_t>(std::strlen(path)), static_cast<int32_t>(std::strlen(other)),
                           offset, bytes ? size : 0};
-    const std::array<iovec, 4> parts{
-        {{&change, sizeof change},
-         {const_cast<char*>(path), static_cast<size_t>(change.pathLength)},
-         {const_cast<char*>(other), static_cast<size_t>(change.otherLength)},
-         {const_cast<void*>(bytes), static_cast<size_t>(change.size)}}};
+    const std::array<iovec, 4> parts{{{&change, sizeof change},
+                                      {const_cast<char*>(path), static_cast<size_t>(change.pathLength)},
+                                      {const_cast<char*>(other), static_cast<size_t>(change.otherLength)},
+                                      {const_cast<void*>(bytes), static_cast<size_t>(change.size)}}};
     static const auto real = next(&::writev, "writev");
     [[maybe_unused]] const ssize_t n = real(file, parts.data(), parts.size());
     errno = before;

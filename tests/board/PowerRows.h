@@ -1,0 +1,9 @@
+#pragma once
+
+#include "Board.h"
+
+namespace rolvane::board {
+
+void losePower(Work& work);
+
+} // namespace rolvane::board
