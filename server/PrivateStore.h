@@ -1,5 +1,7 @@
 #pragma once
 
+#include "server/HttpdLauncher.h"
+
 #include <chrono>
 #include <memory>
 #include <optional>
@@ -77,7 +79,7 @@ public:
     // another program holds is an error, not a reason to move, as clients know the store by it.
     void start();
 
-    enum class Stop { gracefully, atOnce };
+    using Stop = HttpdLauncher::Stop;
     // Returns when the process is gone; requests under way are finished first if asked. Nothing when not running.
     void stop(Stop how = Stop::atOnce);
 

@@ -151,6 +151,20 @@ bool StoreCertificates::ensure(const std::vector<std::string>& hosts, std::chron
     return true;
 }
 
+std::string StoreCertificates::fingerprint() const {
+    const Certificate certificate = readCertificate(certificateFile());
+    unsigned char digest[EVP_MAX_MD_SIZE];
+    unsigned int size = 0;
+    if (!certificate || X509_digest(certificate.get(), EVP_sha256(), digest, &size) != 1) return {};
+    std::string text;
+    for (unsigned int i = 0; i < size; ++i) {
+        if (i > 0) text += ':';
+        text += "0123456789ABCDEF"[digest[i] >> 4];
+        text += "0123456789ABCDEF"[digest[i] & 15];
+    }
+    return text;
+}
+
 bool StoreCertificates::areGoodFor(const std::vector<std::string>& hosts, std::chrono::seconds lifetime) const {
     const Certificate authority = readCertificate(caFile());
     const Certificate server = readCertificate(certificateFile());

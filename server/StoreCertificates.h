@@ -20,6 +20,9 @@ public:
     // lifetime (at most 30 days) of their end. True when it made them. CXException on failure.
     bool ensure(const std::vector<std::string>& hosts, std::chrono::seconds lifetime);
 
+    // SHA-256 of the server's certificate as clients show it, "AB:CD:..."; "" when there is none.
+    std::string fingerprint() const;
+
     std::string caFile() const { return _directory + "/ca.pem"; }
     std::string certificateFile() const { return _directory + "/server.pem"; }
     std::string keyFile() const { return _directory + "/server.key"; }

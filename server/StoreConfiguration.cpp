@@ -1,35 +1,13 @@
 #include "server/StoreConfiguration.h"
 
 #include "foundation/CXException.h"
+#include "server/HttpdTemplate.h"
 
 #include <algorithm>
-#include <filesystem>
-#include <map>
-#include <unistd.h>
 
 namespace rolvane {
 
 namespace {
-
-std::string programDirectory() {
-    std::error_code error;
-    return std::filesystem::read_symlink("/proc/self/exe", error).parent_path().string();
-}
-
-void refuseUnsafePath(const std::string& path) {
-    const bool unsafe = path.find_first_of("\"\\\n\r") != std::string::npos || path.find("${") != std::string::npos;
-    if (unsafe || path.empty() || path[0] != '/')
-        throw CXException(kCXPrivateStoreException, "The store cannot be kept in \"" + path +
-                                                        "\": the path must be absolute and hold no quotation mark, "
-                                                        "backslash, line break or \"${\". Choose another directory.");
-}
-
-void refuseUnsafeWord(const std::string& what, const std::string& word) {
-    const bool safe = !word.empty() && std::all_of(word.begin(), word.end(), [](char c) {
-        return (c >= 'a' && c <= 'z') || (c >= '0' && c <= '9') || c == ':' || c == ' ' || c == '_';
-    });
-    if (!safe) throw CXException(kCXPrivateStoreException, "The store's " + what + " \"" + word + "\" is none.");
-}
 
 std::string switches(const PrivateStoreOptions& options) {
     std::string text;
@@ -41,27 +19,6 @@ std::string switches(const PrivateStoreOptions& options) {
     if (options.needsModule()) text += "Define DAVACL\n";
     if (options.keepsAccessLists()) text += "Define ACCESSLISTS\n";
     return text;
-}
-
-std::string joined(const std::vector<std::string>& lines) {
-    std::string text;
-    for (const auto& line : lines) text += line + "\n";
-    return text;
-}
-
-// Replaces every @NAME@; a name that is not known stays, and httpd complains about it.
-std::string substitute(const std::string& text, const std::map<std::string, std::string>& names) {
-    std::string out;
-    for (size_t from = 0; from < text.size();) {
-        const size_t at = text.find('@', from);
-        const size_t end = at == std::string::npos ? at : text.find('@', at + 1);
-        if (end == std::string::npos) return out + text.substr(from);
-        const auto known = names.find(text.substr(at + 1, end - at - 1));
-        out += text.substr(from, at - from);
-        out += known == names.end() ? text.substr(at, end - at) : known->second;
-        from = known == names.end() ? end : end + 1;
-    }
-    return out;
 }
 
 constexpr const char* kAuthenticationNames[] = {"none", "basic", "digest"};
@@ -81,31 +38,18 @@ std::vector<std::string> toStrings(const Array& array) {
 } // namespace
 
 std::string storeTemplatePath() {
-    const std::string candidates[] = {programDirectory() + "/../share/rolvane/httpd.conf.in",
-                                      ROLVANE_SERVER_SOURCE_DIR "/httpd.conf.in",
-                                      ROLVANE_INSTALLED_SHARE "/httpd.conf.in"};
-    for (const auto& path : candidates)
-        if (access(path.c_str(), R_OK) == 0) return path;
-    throw CXException(kCXPrivateStoreException, "The store's configuration template httpd.conf.in is missing from " +
-                                                    std::string(ROLVANE_INSTALLED_SHARE) + ". Install rolvane again.");
+    return httpdTemplatePath("httpd.conf.in");
 }
 
 std::string storeAccessModulePath(const std::string& httpdModules) {
-    // What was built or installed together with the program comes before what the system may have from another version.
-    const std::string candidates[] = {programDirectory() + "/../lib/apache2/modules/mod_davacl.so",
-                                      ROLVANE_BUILT_DAVACL,
-
-                                      ROLVANE_INSTALLED_MODULES "/mod_davacl.so", httpdModules + "/mod_davacl.so"};
-    for (const auto& path : candidates)
-        if (access(path.c_str(), R_OK) == 0) return path;
-    return {};
+    return httpdModulePath("mod_davacl.so", ROLVANE_BUILT_DAVACL, httpdModules);
 }
 
 std::string renderStoreConfiguration(const std::string& templateText, const PrivateStoreOptions& options, int port,
                                      bool withIPv6) {
     for (const auto& path : {options.stateDirectory, options.documentRoot, options.httpdModules})
-        refuseUnsafePath(path);
-    refuseUnsafeWord("log level", options.logLevel);
+        refuseUnsafePath("The store", path);
+    refuseUnsafeWord("The store", "log level", options.logLevel);
     const std::string module = !options.needsModule()         ? "/none"
                                : options.accessModule.empty() ? storeAccessModulePath(options.httpdModules)
                                                               : options.accessModule;
@@ -113,28 +57,28 @@ std::string renderStoreConfiguration(const std::string& templateText, const Priv
         throw CXException(kCXPrivateStoreException,
                           "The store's access lists and passwords need mod_davacl.so, which is missing from " +
                               std::string(ROLVANE_INSTALLED_MODULES) + ". Install rolvane again.");
-    refuseUnsafePath(module);
+    refuseUnsafePath("The store", module);
     const std::string number = std::to_string(port);
     const int threads = std::clamp(options.threadsPerProcess, 1, 1000);
     const int processes = std::clamp(options.processes, 1, 100);
     const int limit = std::clamp(options.maximumProcesses, processes, 100);
     return switches(options) +
-           substitute(templateText,
-                      {{"STATE", options.stateDirectory},
-                       {"ROOT", options.documentRoot},
-                       {"MODULES", options.httpdModules},
-                       {"DAVACL", module},
-                       {"REALM", kStoreRealm},
-                       {"LISTEN", "Listen 127.0.0.1:" + number + (withIPv6 ? "\nListen [::1]:" + number : "")},
-                       {"PROCESSES", std::to_string(processes)},
-                       {"SERVER_LIMIT", std::to_string(2 * limit)},
-                       {"THREADS", std::to_string(threads)},
-                       {"SPARE_THREADS", std::to_string(std::max(threads / 2, 1))},
-                       {"WORKERS", std::to_string(threads * limit)},
-                       {"KEEPALIVE_TIMEOUT", std::to_string(std::max(options.keepAliveSeconds, 1))},
-                       {"KEEPALIVE_REQUESTS", std::to_string(std::max(options.maximumKeepAliveRequests, 0))},
-                       {"LOG_LEVEL", options.logLevel},
-                       {"EXTRA", joined(options.extraConfiguration)}});
+           filledIn(templateText,
+                    {{"STATE", options.stateDirectory},
+                     {"ROOT", options.documentRoot},
+                     {"MODULES", options.httpdModules},
+                     {"DAVACL", module},
+                     {"REALM", kStoreRealm},
+                     {"LISTEN", "Listen 127.0.0.1:" + number + (withIPv6 ? "\nListen [::1]:" + number : "")},
+                     {"PROCESSES", std::to_string(processes)},
+                     {"SERVER_LIMIT", std::to_string(2 * limit)},
+                     {"THREADS", std::to_string(threads)},
+                     {"SPARE_THREADS", std::to_string(std::max(threads / 2, 1))},
+                     {"WORKERS", std::to_string(threads * limit)},
+                     {"KEEPALIVE_TIMEOUT", std::to_string(std::max(options.keepAliveSeconds, 1))},
+                     {"KEEPALIVE_REQUESTS", std::to_string(std::max(options.maximumKeepAliveRequests, 0))},
+                     {"LOG_LEVEL", options.logLevel},
+                     {"EXTRA", joinedLines(options.extraConfiguration)}});
 }
 
 std::string renderStoreUsers(const std::string& davDirectory, const std::vector<std::string>& users,

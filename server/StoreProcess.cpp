@@ -52,7 +52,8 @@ bool becomeIdentity(const StoreIdentity& identity) {
         return false;
     if (!identity.passFileModes) return true;
     // Containers often withhold the narrower right.
-    return keepCapability(inBoundingSet(CAP_DAC_READ_SEARCH) ? CAP_DAC_READ_SEARCH : CAP_DAC_OVERRIDE);
+    const bool readOnly = !identity.changeFiles && inBoundingSet(CAP_DAC_READ_SEARCH);
+    return keepCapability(readOnly ? CAP_DAC_READ_SEARCH : CAP_DAC_OVERRIDE);
 }
 
 // A connection is a descriptor, and a session's usual limit is a thousand of them.

@@ -36,6 +36,7 @@ struct StoreIdentity {
     gid_t gid = 0;
     std::string name;
     bool passFileModes = false; // keep the right to read and search past file modes
+    bool changeFiles = false;   // with passFileModes: and to write
 
     // www-data, else nobody, for root; the process's own user for anybody else. CXException when root has neither.
     static StoreIdentity choose();

@@ -1,3 +1,4 @@
+#include "Books.h"
 #include "Conflicts.h"
 #include "Context.h"
 #include "Counted.h"
@@ -191,6 +192,7 @@ Json status(Context& context) {
             {"publicationEnded", endedJson(preferences, publication.anything())},
             {"leftOnStore", anythingLeftOnStore(database, preferences)},
             {"subscriptions", subscriptions},
+            {"books", booksJson()},
             {"withdrawn", withdrawnJson()},
             {"refused", refusedJson(preferences)},
             {"conflicts", conflictsJson(database)},
@@ -255,6 +257,10 @@ void showStatus(Context& context) {
     if (s["leftOnStore"])
         row("", "files of what was withdrawn are still on the store; the same `rolvane unpublish` again removes them");
     row("Subscribed", subscribedText(s["subscriptions"]));
+    if (!s["books"].is_null()) {
+        row("Address books", booksText(s["books"]));
+        for (const Json& link : s["books"]["links"]) row("Linked", linkText(link));
+    }
     for (const Json& record : s["withdrawn"]) row("Withdrawn", withdrawnText(record));
     for (const Json& record : s["refused"]) row("Refused", refusedText(record));
     for (const Json& conflict : s["conflicts"])

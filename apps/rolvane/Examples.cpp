@@ -68,6 +68,14 @@ const std::map<std::string, const char*>& examples() {
         {"defaults write", "  rolvane defaults write CXDDebugLevel 1 --type int"},
         {"store start", "  rolvane store start\n"
                         "  rolvane store start --directory ~/stores/work --port 8443"},
+        {"books on", "  rolvane books on && rolvane books device add laptop\n"
+                     "  rolvane books on --listen 192.168.1.20"},
+        {"books device add", "  rolvane books device add laptop\n"
+                             "  rolvane books device add phone --qr"},
+        {"books link",
+         "  rolvane books link https://cloud.example.org/remote.php/dav/addressbooks/users/ada/contacts/ \\\n"
+         "      --user ada --password-command 'pass show cloud.example.org'"},
+        {"books device remove", "  rolvane books device remove phone"},
         {"store user add", "  rolvane store user add alice"},
     };
     return all;

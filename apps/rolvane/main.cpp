@@ -88,6 +88,7 @@ int main(int argc, char** argv) {
     addDaemonCommands(app, context);
     addPreferencesCommands(app, context);
     addStoreCommands(app, context);
+    addBooksCommands(app, context);
     addDatabaseCommands(app, context);
 
     try {

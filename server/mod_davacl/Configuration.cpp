@@ -71,6 +71,12 @@ const char* setUserFile(cmd_parms* cmd, void*, const char* path) {
     return c->userFile ? nullptr : "the argument must be the path of a password file";
 }
 
+const char* setLastUse(cmd_parms* cmd, void*, const char* path) {
+    Configuration* c = ofServer(cmd->server);
+    c->lastUse = ap_server_root_relative(cmd->pool, path);
+    return c->lastUse ? nullptr : "the argument must be the path of a directory";
+}
+
 const char* addUsers(cmd_parms* cmd, void*, const char* provider) {
     Configuration* c = ofServer(cmd->server);
     if (!ap_lookup_provider(AUTHN_PROVIDER_GROUP, provider, AUTHN_PROVIDER_VERSION))
@@ -106,6 +112,11 @@ const char* setStrict(cmd_parms* cmd, void*, int on) {
 
 const char* setParks(cmd_parms* cmd, void*, int on) {
     ofServer(cmd->server)->parks = on;
+    return nullptr;
+}
+
+const char* setSlows(cmd_parms* cmd, void*, int on) {
+    ofServer(cmd->server)->slows = on;
     return nullptr;
 }
 
@@ -149,6 +160,16 @@ const char* userFileOf(const request_rec* r) {
     return c ? c->userFile : nullptr;
 }
 
+bool slowsGuesses(const request_rec* r) {
+    const Configuration* c = ofServer(r->server);
+    return c && c->slows > 0;
+}
+
+const char* lastUseDirectoryOf(const request_rec* r) {
+    const Configuration* c = ofServer(r->server);
+    return c ? c->lastUse : nullptr;
+}
+
 bool parksConnections(const server_rec* server) {
     const Configuration* c = ofServer(server);
     return c && c->parks > 0;
@@ -170,6 +191,8 @@ void* mergeConfigurations(apr_pool_t* pool, void* base, void* more) {
     if (inner->groupFile) merged->groupFile = inner->groupFile;
     if (inner->users) merged->users = inner->users;
     if (inner->userFile) merged->userFile = inner->userFile;
+    if (inner->lastUse) merged->lastUse = inner->lastUse;
+    if (inner->slows >= 0) merged->slows = inner->slows;
     if (inner->strict >= 0) merged->strict = inner->strict;
     if (inner->parks >= 0) merged->parks = inner->parks;
     if (inner->depth) merged->depth = inner->depth;
@@ -255,6 +278,10 @@ const command_rec kDirectives[] = {
      "whether a way around the lists that cannot be closed keeps httpd from starting: On by default"},
     {"DavAclParkConnections", asCommand(setParks), nullptr, RSRC_CONF, FLAG,
      "whether connections that say nothing wait without a thread: Off by default"},
+    {"DavAclSlowGuesses", asCommand(setSlows), nullptr, RSRC_CONF, FLAG,
+     "whether passwords are not looked at for a while after wrong ones from the same address: Off by default"},
+    {"DavAclLastUse", asCommand(setLastUse), nullptr, RSRC_CONF, TAKE1,
+     "a directory in which the date of the file with a user's name tells when that user signed in last"},
     {"DavAclMaxEntries", asCommand(setMaxEntries), nullptr, RSRC_CONF, TAKE1,
      "how many entries a list may hold: 1000 by default"},
     {"DavAclDepth", asCommand(setDepth), nullptr, RSRC_CONF, TAKE1,

@@ -12,9 +12,11 @@ struct Configuration {
     const char* groupFile = nullptr;     // null: no groups
     apr_array_header_t* users = nullptr; // of const char*: the authentication providers that know who exists
     const char* userFile = nullptr;      // null: none; who stands in it exists, and no provider is asked
+    const char* lastUse = nullptr;       // a directory; null: nobody's last use is noted
     int entries = 0;                     // the most that a list holds
     int strict = -1;                     // whether a way around the lists keeps httpd from starting; -1: not said
     int parks = -1;                      // whether silent connections wait without a thread; -1: not said
+    int slows = -1;                      // whether guesses of passwords are slowed down; -1: not said
     int depth = 0;                       // how many segments below the base may have lists of their own
 
     bool isStrict() const { return strict != 0; }
@@ -28,6 +30,9 @@ const Configuration* configurationOf(const request_rec* r);
 
 // DavAclUserFile's argument, with or without a base; null when there is none.
 const char* userFileOf(const request_rec* r);
+// DavAclSlowGuesses, and DavAclLastUse's argument (null when there is none).
+bool slowsGuesses(const request_rec* r);
+const char* lastUseDirectoryOf(const request_rec* r);
 // DavAclParkConnections, of the host that the connection came to.
 bool parksConnections(const server_rec* server);
 

@@ -2,6 +2,7 @@
 
 #include "daemon/InstanceLock.h"
 #include "foundation/Paths.h"
+#include "foundation/QuietProgram.h"
 
 #include <cerrno>
 #include <chrono>
@@ -61,24 +62,6 @@ bool waitReadable(int fd, double seconds) {
         const int n = ::poll(&p, 1, static_cast<int>(std::max<long long>(0, left.count())));
         if (n >= 0 || errno != EINTR) return n > 0;
     }
-}
-
-// Runs a program without input or output; its exit status, or -1 when it could not be run.
-int runQuietly(std::vector<std::string> arguments) {
-    std::vector<char*> argv;
-    for (std::string& a : arguments) argv.push_back(a.data());
-    argv.push_back(nullptr);
-    posix_spawn_file_actions_t actions;
-    posix_spawn_file_actions_init(&actions);
-    for (int fd : {0, 1, 2}) posix_spawn_file_actions_addopen(&actions, fd, "/dev/null", O_RDWR, 0);
-    pid_t pid = 0;
-    const int error = ::posix_spawnp(&pid, argv[0], &actions, nullptr, argv.data(), environ);
-    posix_spawn_file_actions_destroy(&actions);
-    if (error != 0) return -1;
-    int status = 0;
-    while (::waitpid(pid, &status, 0) < 0)
-        if (errno != EINTR) return -1;
-    return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
 
 // Where the daemon says that it is ready: a socket without a file, which is gone with this process however it ends.
