@@ -1,0 +1,288 @@
+// `rolvane books` with the real httpd and module, asked by curl.
+
+#include "foundation/CXException.h"
+#include "server/BooksServer.h"
+#include "support/UserWorld.h"
+
+#include <fstream>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <nlohmann/json.hpp>
+#include <sstream>
+#include <sys/stat.h>
+#include <unistd.h>
+
+namespace rolvane::test {
+namespace {
+
+using testing::HasSubstr;
+using testing::Not;
+using Json = nlohmann::json;
+
+class Books : public testing::Test {
+protected:
+    Books() { done({"add", "--first", "Ada", "--last", "Miller", "--email", "ada@example.org"}); }
+    ~Books() override { world.rolvane({"books", "off"}); }
+
+    std::string done(std::vector<std::string> arguments) {
+        const Ran ran = world.rolvane(std::move(arguments));
+        EXPECT_EQ(ran.status, 0) << ran;
+        return ran.output;
+    }
+    Json json(std::vector<std::string> arguments, int status = 0) {
+        arguments.emplace_back("--json");
+        const Ran ran = world.rolvane(std::move(arguments));
+        EXPECT_EQ(ran.status, status) << ran;
+        return Json::parse(ran.output, nullptr, false);
+    }
+    // What curl says: the status, a line end, the body. It trusts the books' own authority and nothing else.
+    std::string ask(const std::string& device, const std::string& password, const std::string& path = "books/",
+                    std::vector<std::string> more = {}) {
+        const Json told = Json::parse(world.rolvane({"books", "status", "--json"}).output);
+        std::vector<std::string> command = {"curl", "-q", "-sS", "--noproxy", "*", "-w", "\n%{http_code}"};
+        if (!told["caFile"].is_null()) command.insert(command.end(), {"--cacert", told["caFile"]});
+        if (!device.empty()) command.insert(command.end(), {"-u", device + ":" + password});
+        command.insert(command.end(), more.begin(), more.end());
+        command.push_back(told["url"].get<std::string>() + path);
+        const Ran ran = world.run(command);
+        EXPECT_EQ(ran.status, 0) << ran;
+        const size_t end = ran.output.rfind('\n');
+        return ran.output.substr(end + 1) + "\n" + ran.output.substr(0, end);
+    }
+    std::string status(const std::string& device, const std::string& password) {
+        return ask(device, password, "books/", {"-X", "PROPFIND", "-H", "Depth: 0"}).substr(0, 3);
+    }
+    std::string addDevice(const std::string& name) { return json({"books", "device", "add", name})["password"]; }
+
+    UserWorld world;
+};
+
+TEST_F(Books, AreServedToADeviceWithItsPasswordAndToNobodyElse) {
+    const Json on = json({"books", "on"});
+    EXPECT_TRUE(on["on"].get<bool>());
+    EXPECT_THAT(on["url"].get<std::string>(), testing::MatchesRegex("https://localhost:[0-9]+/"));
+    const std::string password = addDevice("laptop");
+    const std::string listing = ask("laptop", password, "books/home/contacts/", {"-X", "PROPFIND", "-H", "Depth: 1"});
+    EXPECT_THAT(listing, testing::StartsWith("207\n"));
+    EXPECT_THAT(listing, HasSubstr(".vcf</"));
+    EXPECT_EQ(status("", ""), "401");
+    EXPECT_EQ(status("laptop", "wrong"), "401");
+    EXPECT_EQ(status("phone", password), "401");
+    EXPECT_EQ(ask("", "", ".well-known/carddav").substr(0, 3), "301");
+    EXPECT_EQ(ask("laptop", password, "../conf/passwords", {"--path-as-is"}).substr(0, 3), "400");
+    EXPECT_EQ(ask("laptop", password, "conf/passwords").substr(0, 3), "403");
+}
+
+TEST_F(Books, ADeviceThatIsRemovedOrGotAnotherPasswordIsRefusedAtTheNextRequest) {
+    done({"books", "on"});
+    const std::string first = addDevice("phone"), laptop = addDevice("laptop");
+    ASSERT_EQ(status("phone", first), "207");
+    const Ran again = world.rolvane({"books", "device", "add", "phone"});
+    EXPECT_EQ(again.status, 2) << again;
+    EXPECT_THAT(again.errors, HasSubstr("--renew"));
+    EXPECT_EQ(status("phone", first), "207");
+    const std::string second = json({"books", "device", "add", "phone", "--renew"})["password"];
+    EXPECT_EQ(status("phone", first), "401");
+    EXPECT_EQ(status("phone", second), "207");
+    done({"books", "device", "remove", "phone"});
+    EXPECT_EQ(status("phone", second), "401");
+    EXPECT_EQ(status("laptop", laptop), "207");
+    EXPECT_EQ(world.rolvane({"books", "device", "remove", "phone"}).status, 3);
+}
+
+TEST_F(Books, TellWhenADeviceWasThereLast) {
+    done({"books", "on"});
+    const std::string password = addDevice("laptop");
+    addDevice("phone");
+    ASSERT_EQ(status("laptop", password), "207");
+    const Json devices = json({"books", "devices"});
+    ASSERT_EQ(devices.size(), 2U);
+    EXPECT_EQ(devices[0]["name"], "laptop");
+    EXPECT_TRUE(devices[0]["lastUse"].is_string());
+    EXPECT_TRUE(devices[1]["lastUse"].is_null());
+    EXPECT_THAT(done({"books", "devices"}), HasSubstr("phone               never used"));
+}
+
+TEST_F(Books, KeepPortDevicesAndCertificateFromOnToOn) {
+    const Json first = json({"books", "on"});
+    const std::string password = addDevice("laptop");
+    EXPECT_EQ(json({"books", "on"})["process"], first["process"]) << "nothing has changed, so nothing is started anew";
+    done({"books", "off"});
+    EXPECT_EQ(json({"books", "status"}, 3)["on"], false);
+    const Json second = json({"books", "on"});
+    EXPECT_EQ(second["url"], first["url"]);
+    EXPECT_EQ(second["fingerprint"], first["fingerprint"]);
+    EXPECT_EQ(status("laptop", password), "207");
+    const Json plain = json({"books", "on", "--no-tls"});
+    EXPECT_THAT(plain["url"].get<std::string>(), testing::StartsWith("http://localhost:"));
+    EXPECT_EQ(status("laptop", password), "207");
+    EXPECT_EQ(status("laptop", "wrong"), "401");
+}
+
+TEST_F(Books, KeepSecretsToTheirUser) {
+    done({"books", "on"});
+    const std::string password = addDevice("laptop");
+    const std::string state = world.home / "state/rolvane/books";
+    for (const char* secret : {"/conf/passwords", "/tls/server.key", "/conf/httpd.conf"}) {
+        struct stat info {};
+        ASSERT_EQ(stat((state + secret).c_str(), &info), 0) << secret;
+        EXPECT_EQ(info.st_mode & 077, 0U) << secret;
+    }
+    struct stat info {};
+    ASSERT_EQ(stat(state.c_str(), &info), 0);
+    EXPECT_EQ(info.st_mode & 077, 0U);
+    std::ifstream file(state + "/conf/passwords");
+    const std::string text(std::istreambuf_iterator<char>(file), {});
+    EXPECT_THAT(text, Not(HasSubstr(password)));
+}
+
+TEST_F(Books, GuessesArePutOffAndADeviceThatIsInStaysIn) {
+    done({"books", "on"});
+    const std::string laptop = addDevice("laptop"), phone = addDevice("phone");
+    ASSERT_EQ(status("laptop", laptop), "207");
+    for (int i = 0; i < 8; ++i) EXPECT_EQ(status("phone", "guess" + std::to_string(i)), "401");
+    EXPECT_EQ(status("phone", phone), "401") << "in a pause the right one is not looked at either";
+    EXPECT_EQ(status("laptop", laptop), "207");
+}
+
+TEST_F(Books, ThatAreWantedElsewhereNeedTLSAndAnAddress) {
+    const Ran plain = world.rolvane({"books", "on", "--listen", "127.0.0.1", "--no-tls"});
+    EXPECT_EQ(plain.status, 1) << plain;
+    EXPECT_THAT(plain.errors, HasSubstr("Leave out --listen or --no-tls"));
+    const Ran named = world.rolvane({"books", "on", "--listen", "my-machine"});
+    EXPECT_EQ(named.status, 1) << named;
+    EXPECT_THAT(named.errors, HasSubstr("is no address of this machine"));
+    EXPECT_EQ(world.rolvane({"books", "on", "--listen", "127.0.0.2", "--loopback"}).status, 2);
+    EXPECT_EQ(json({"books", "status"}, 3)["on"], false);
+}
+
+// The code is read by a reader of its own.
+TEST_F(Books, AQRCodeHoldsAddressNameAndPassword) {
+    const Json on = json({"books", "on"});
+    const Ran ran = world.rolvane({"books", "device", "add", "my@phone", "--qr"});
+    ASSERT_EQ(ran.status, 0) << ran;
+    std::vector<std::string> rows; // '1' is dark
+    std::string password;
+    std::istringstream lines(ran.output);
+    for (std::string line; std::getline(lines, line);) {
+        if (line.starts_with("Password ")) password = line.substr(line.rfind(' ') + 1);
+        if (line.starts_with("Address ") || line.starts_with("User name ") || line.starts_with("Password ")) continue;
+        std::string upper, lower;
+        for (size_t i = 0; i < line.size();) {
+            const std::string block = line[i] == ' ' ? " " : line.substr(i, 3);
+            i += block.size();
+            upper += block == "█" || block == "▀" ? "0 " : "1 ";
+            lower += block == "█" || block == "▄" ? "0 " : "1 ";
+        }
+        rows.push_back(upper);
+        rows.push_back(lower);
+    }
+    ASSERT_GT(rows.size(), 20U);
+    constexpr size_t kScale = 4; // pixels a module
+    std::string picture =
+        "P1\n" + std::to_string(rows[0].size() / 2 * kScale) + " " + std::to_string(rows.size() * kScale) + "\n";
+    for (const std::string& row : rows) {
+        std::string wide;
+        for (size_t i = 0; i < row.size(); i += 2)
+            for (size_t k = 0; k < kScale; ++k) wide += row.substr(i, 2);
+        for (size_t k = 0; k < kScale; ++k) picture += wide + "\n";
+    }
+    const Ran read = world.run({"zbarimg", "-q", "--raw", world.write("code.pbm", picture)});
+    const std::string url = on["url"];
+    EXPECT_EQ(read.output, "carddavs://my%40phone:" + password + "@" + url.substr(url.find("localhost")) + "\n")
+        << read;
+}
+
+TEST_F(Books, SayWhatToDoWhenTheyCannotBeSwitchedOn) {
+    const Ran device = world.rolvane({"books", "device", "add", "phone"});
+    EXPECT_EQ(device.status, 1) << device;
+    EXPECT_THAT(device.errors, HasSubstr("rolvane books on"));
+    EXPECT_THAT(json({"books", "devices"}), testing::IsEmpty()) << "a password that nobody has seen is no use";
+    const int port = json({"books", "on"})["port"];
+    BooksOptions options = BooksServer::savedOptions(world.home / "state/rolvane/books").value();
+    options.stateDirectory = world.home / "second";
+    options.serviceManager = false;
+    const auto reasonOf = [](const BooksOptions& given) -> std::string {
+        try {
+            BooksServer(given).on();
+        } catch (const CXException& e) {
+            return e.reason();
+        }
+        return "";
+    };
+    options.port = port;
+    EXPECT_THAT(reasonOf(options),
+                testing::AllOf(HasSubstr("port " + std::to_string(port) + ", which is taken"), HasSubstr("--port")));
+    options.port = 0;
+    options.httpdProgram = "/nowhere/apache2";
+    EXPECT_THAT(reasonOf(options), HasSubstr("Install the package apache2-bin"));
+    options.httpdProgram = BooksOptions().httpdProgram;
+    options.database = world.home / "none.db";
+    EXPECT_THAT(reasonOf(options), HasSubstr("There is no contact database at"));
+}
+
+// A user who is not root, whoever runs the test.
+class BooksOfAnOrdinaryUser : public Books {
+protected:
+    BooksOfAnOrdinaryUser() {
+        if (geteuid() != 0) return;
+        _prefix = {"setpriv", "--reuid", "65534", "--regid", "65534", "--clear-groups"};
+        world.run({"chown", "-R", "65534:65534", world.home.path()});
+    }
+    ~BooksOfAnOrdinaryUser() override { user({"books", "off"}); }
+    Ran run(std::vector<std::string> command) {
+        command.insert(command.begin(), _prefix.begin(), _prefix.end());
+        return world.run(command);
+    }
+    Ran user(std::vector<std::string> arguments) {
+        arguments.insert(arguments.begin(), UserWorld::rolvaneProgram());
+        return run(arguments);
+    }
+    std::string codeOf(const std::string& url, const Json& on, const std::string& password) {
+        return run({"curl", "-q", "-sS", "--noproxy", "*", "--cacert", on["caFile"], "-o", "/dev/null", "-w",
+                    "%{http_code}", "-u", "phone:" + password, "-X", "PROPFIND", "-H", "Depth: 0", url + "books/"})
+            .output;
+    }
+
+private:
+    std::vector<std::string> _prefix;
+};
+
+TEST_F(BooksOfAnOrdinaryUser, AreReachedAtTheAddressThatWasAskedFor) {
+    const Ran ran = user({"books", "on", "--listen", "127.0.0.2", "--host", "books.example.org", "--json"});
+    ASSERT_EQ(ran.status, 0) << ran;
+    const Json on = Json::parse(ran.output);
+    EXPECT_THAT(on["outsideURL"].get<std::string>(), testing::StartsWith("https://127.0.0.2:"));
+    const Ran device = user({"books", "device", "add", "phone", "--json"});
+    ASSERT_EQ(device.status, 0) << device;
+    const Json phone = Json::parse(device.output);
+    EXPECT_EQ(phone["url"], on["outsideURL"]) << "the device is told the address that it can reach";
+    EXPECT_EQ(codeOf(on["outsideURL"], on, phone["password"]), "207");
+    EXPECT_EQ(codeOf(on["url"], on, phone["password"]), "207");
+    const Ran back = user({"books", "on", "--loopback", "--json"});
+    EXPECT_TRUE(Json::parse(back.output)["outsideURL"].is_null()) << back;
+}
+
+TEST_F(BooksOfAnOrdinaryUser, AServiceManagerKeepsThePortAndHandsConnectionsOn) {
+    ASSERT_EQ(symlink(ROLVANE_SOURCE_DIR "/tests/books/service-manager", (world.home / "systemctl").c_str()), 0);
+    world.home.setVariable("PATH", world.home.path() + ":" + std::getenv("PATH"));
+    const Ran ran = user({"books", "on", "--json"});
+    ASSERT_EQ(ran.status, 0) << ran;
+    const Json on = Json::parse(ran.output);
+    EXPECT_EQ(on["startedBy"], "systemd");
+    EXPECT_TRUE(on["on"].get<bool>());
+    const Json phone = Json::parse(user({"books", "device", "add", "phone", "--json"}).output);
+    EXPECT_EQ(codeOf(on["url"], on, phone["password"]), "207") << "TLS and all, through the unit's socket";
+    EXPECT_EQ(codeOf(on["url"], on, "wrong"), "401");
+    EXPECT_EQ(user({"books", "off"}).status, 0);
+    const Ran status = user({"books", "status", "--json"});
+    EXPECT_EQ(status.status, 3) << status;
+    std::ifstream file(world.home / "asked");
+    const std::string asked(std::istreambuf_iterator<char>(file), {});
+    EXPECT_THAT(asked, HasSubstr("--user daemon-reload\n--user enable --now rolvane-books.socket\n"));
+    EXPECT_THAT(asked, HasSubstr("--user disable --now rolvane-books.socket\n"));
+    EXPECT_FALSE(std::ifstream(world.home / "config/systemd/user/rolvane-books.socket").good()) << "taken back";
+}
+
+} // namespace
+} // namespace rolvane::test
