@@ -19,10 +19,10 @@ using testing::HasSubstr;
 using testing::Not;
 using Json = nlohmann::json;
 
-class Books : public testing::Test {
+class BooksCommand : public testing::Test {
 protected:
-    Books() { done({"add", "--first", "Ada", "--last", "Miller", "--email", "ada@example.org"}); }
-    ~Books() override { world.rolvane({"books", "off"}); }
+    BooksCommand() { done({"add", "--first", "Ada", "--last", "Miller", "--email", "ada@example.org"}); }
+    ~BooksCommand() override { world.rolvane({"books", "off"}); }
 
     std::string done(std::vector<std::string> arguments) {
         const Ran ran = world.rolvane(std::move(arguments));
@@ -57,7 +57,7 @@ protected:
     UserWorld world;
 };
 
-TEST_F(Books, AreServedToADeviceWithItsPasswordAndToNobodyElse) {
+TEST_F(BooksCommand, AreServedToADeviceWithItsPasswordAndToNobodyElse) {
     const Json on = json({"books", "on"});
     EXPECT_TRUE(on["on"].get<bool>());
     EXPECT_THAT(on["url"].get<std::string>(), testing::MatchesRegex("https://localhost:[0-9]+/"));
@@ -73,7 +73,7 @@ TEST_F(Books, AreServedToADeviceWithItsPasswordAndToNobodyElse) {
     EXPECT_EQ(ask("laptop", password, "conf/passwords").substr(0, 3), "403");
 }
 
-TEST_F(Books, ADeviceThatIsRemovedOrGotAnotherPasswordIsRefusedAtTheNextRequest) {
+TEST_F(BooksCommand, ADeviceThatIsRemovedOrGotAnotherPasswordIsRefusedAtTheNextRequest) {
     done({"books", "on"});
     const std::string first = addDevice("phone"), laptop = addDevice("laptop");
     ASSERT_EQ(status("phone", first), "207");
@@ -90,7 +90,7 @@ TEST_F(Books, ADeviceThatIsRemovedOrGotAnotherPasswordIsRefusedAtTheNextRequest)
     EXPECT_EQ(world.rolvane({"books", "device", "remove", "phone"}).status, 3);
 }
 
-TEST_F(Books, TellWhenADeviceWasThereLast) {
+TEST_F(BooksCommand, TellWhenADeviceWasThereLast) {
     done({"books", "on"});
     const std::string password = addDevice("laptop");
     addDevice("phone");
@@ -103,7 +103,7 @@ TEST_F(Books, TellWhenADeviceWasThereLast) {
     EXPECT_THAT(done({"books", "devices"}), HasSubstr("phone               never used"));
 }
 
-TEST_F(Books, KeepPortDevicesAndCertificateFromOnToOn) {
+TEST_F(BooksCommand, KeepPortDevicesAndCertificateFromOnToOn) {
     const Json first = json({"books", "on"});
     const std::string password = addDevice("laptop");
     EXPECT_EQ(json({"books", "on"})["process"], first["process"]) << "nothing has changed, so nothing is started anew";
@@ -119,7 +119,7 @@ TEST_F(Books, KeepPortDevicesAndCertificateFromOnToOn) {
     EXPECT_EQ(status("laptop", "wrong"), "401");
 }
 
-TEST_F(Books, KeepSecretsToTheirUser) {
+TEST_F(BooksCommand, KeepSecretsToTheirUser) {
     done({"books", "on"});
     const std::string password = addDevice("laptop");
     const std::string state = world.home / "state/rolvane/books";
@@ -136,7 +136,7 @@ TEST_F(Books, KeepSecretsToTheirUser) {
     EXPECT_THAT(text, Not(HasSubstr(password)));
 }
 
-TEST_F(Books, GuessesArePutOffAndADeviceThatIsInStaysIn) {
+TEST_F(BooksCommand, GuessesArePutOffAndADeviceThatIsInStaysIn) {
     done({"books", "on"});
     const std::string laptop = addDevice("laptop"), phone = addDevice("phone");
     ASSERT_EQ(status("laptop", laptop), "207");
@@ -145,7 +145,7 @@ TEST_F(Books, GuessesArePutOffAndADeviceThatIsInStaysIn) {
     EXPECT_EQ(status("laptop", laptop), "207");
 }
 
-TEST_F(Books, ThatAreWantedElsewhereNeedTLSAndAnAddress) {
+TEST_F(BooksCommand, ThatAreWantedElsewhereNeedTLSAndAnAddress) {
     const Ran plain = world.rolvane({"books", "on", "--listen", "127.0.0.1", "--no-tls"});
     EXPECT_EQ(plain.status, 1) << plain;
     EXPECT_THAT(plain.errors, HasSubstr("Leave out --listen or --no-tls"));
@@ -157,7 +157,7 @@ TEST_F(Books, ThatAreWantedElsewhereNeedTLSAndAnAddress) {
 }
 
 // The code is read by a reader of its own.
-TEST_F(Books, AQRCodeHoldsAddressNameAndPassword) {
+TEST_F(BooksCommand, AQRCodeHoldsAddressNameAndPassword) {
     const Json on = json({"books", "on"});
     const Ran ran = world.rolvane({"books", "device", "add", "my@phone", "--qr"});
     ASSERT_EQ(ran.status, 0) << ran;
@@ -193,7 +193,7 @@ TEST_F(Books, AQRCodeHoldsAddressNameAndPassword) {
         << read;
 }
 
-TEST_F(Books, SayWhatToDoWhenTheyCannotBeSwitchedOn) {
+TEST_F(BooksCommand, SayWhatToDoWhenTheyCannotBeSwitchedOn) {
     const Ran device = world.rolvane({"books", "device", "add", "phone"});
     EXPECT_EQ(device.status, 1) << device;
     EXPECT_THAT(device.errors, HasSubstr("rolvane books on"));
@@ -222,7 +222,7 @@ TEST_F(Books, SayWhatToDoWhenTheyCannotBeSwitchedOn) {
 }
 
 // A user who is not root, whoever runs the test.
-class BooksOfAnOrdinaryUser : public Books {
+class BooksOfAnOrdinaryUser : public BooksCommand {
 protected:
     BooksOfAnOrdinaryUser() {
         if (geteuid() != 0) return;
