@@ -61,10 +61,12 @@ Path pathOf(int fd) {
 }
 Path absolute(int directory, const char* path) {
     Path whole{};
+    int length = 0;
     if (path[0] == '/')
-        std::snprintf(whole.data(), whole.size(), "%s", path);
+        length = std::snprintf(whole.data(), whole.size(), "%s", path);
     else if (directory != AT_FDCWD)
-        std::snprintf(whole.data(), whole.size(), "%s/%s", pathOf(directory).data(), path);
+        length = std::snprintf(whole.data(), whole.size(), "%s/%s", pathOf(directory).data(), path);
+    if (length < 0 || static_cast<size_t>(length) >= whole.size()) whole[0] = '\0';
     return whole;
 }
 
