@@ -104,7 +104,7 @@ std::string BookAnswer::precondition() const {
 
 // The world --------------------------------------------------------------------------------------------------------
 
-BooksWorld::BooksWorld(Options options) : _port(LoopbackPort::choose()) {
+BooksWorld::BooksWorld(Options options) : _port(LoopbackPort::choose()), _isSanitized(options.sanitized) {
     fs::create_directory(_directory / "run");
     CXRolvane::Options database;
     database.path = this->database();
@@ -124,7 +124,12 @@ BooksWorld::BooksWorld(Options options) : _port(LoopbackPort::choose()) {
     for (const char* name :
          {"mpm_event", "authn_core", "authn_file", "authz_core", "authz_user", "auth_basic", "dav", "alias"})
         file << "LoadModule " << name << "_module " << modules << "/mod_" << name << ".so\n";
-    file << "LoadModule cardbook_module " << ROLVANE_CARDBOOK << "\n";
+#ifdef ROLVANE_SANITIZED_CARDBOOK
+    const std::string module = _isSanitized ? ROLVANE_SANITIZED_CARDBOOK : ROLVANE_CARDBOOK;
+#else
+    const std::string module = ROLVANE_CARDBOOK; // all else has them
+#endif
+    file << "LoadModule cardbook_module " << module << "\n";
     if (geteuid() == 0) file << "User " << kServerUser << "\nGroup " << kServerUser << "\n";
     file << "StartServers 1\nServerLimit 1\nThreadsPerChild 8\nMaxRequestWorkers 8\n"
          << "CardBookDatabase \"" << this->database()
@@ -151,8 +156,16 @@ BooksWorld::~BooksWorld() {
 }
 
 void BooksWorld::start() {
-    _process = std::make_unique<test::ChildProcess>(test::ChildProcess::Options{
-        .arguments = {"/usr/sbin/apache2", "-f", path("httpd.conf"), "-DFOREGROUND"}, .directory = "/"});
+    test::ChildProcess::Options options{.arguments = {"/usr/sbin/apache2", "-f", path("httpd.conf"), "-DFOREGROUND"},
+                                        .directory = "/"};
+#ifdef ROLVANE_SANITIZED_CARDBOOK
+    // httpd was itself built without sanitizers, so it loads them before everything else.
+    if (_isSanitized)
+        options.environment =
+            std::vector<std::string>{"PATH=/usr/bin:/bin", "LD_PRELOAD=" ROLVANE_SANITIZERS,
+                                     "ASAN_OPTIONS=detect_leaks=0", "UBSAN_OPTIONS=print_stacktrace=1"};
+#endif
+    _process = std::make_unique<test::ChildProcess>(std::move(options));
     _process->closeInput();
     constexpr auto kPatience = std::chrono::seconds(20);
     const auto deadline = std::chrono::steady_clock::now() + kPatience;
@@ -165,14 +178,18 @@ void BooksWorld::start() {
 void BooksWorld::stop(bool kill) {
     if (!_process) return;
     if (kill) { // the workers first: they would go on without their parent
-        const std::string pid = std::to_string(_process->pid());
-        std::ifstream children("/proc/" + pid + "/task/" + pid + "/children");
         _process->signal(SIGSTOP);
-        for (pid_t worker = 0; children >> worker;) ::kill(worker, SIGKILL);
+        killWorkers();
     }
     _process->signal(kill ? SIGKILL : SIGTERM);
     _process->wait(20);
     _process.reset();
+}
+
+void BooksWorld::killWorkers() const {
+    const std::string pid = std::to_string(_process->pid());
+    std::ifstream children("/proc/" + pid + "/task/" + pid + "/children");
+    for (pid_t worker = 0; children >> worker;) ::kill(worker, SIGKILL);
 }
 
 void BooksWorld::restart(bool kill) {

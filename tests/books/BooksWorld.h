@@ -44,6 +44,7 @@ class BooksWorld {
 public:
     struct Options {
         std::string directives = {}; // further ones of the server
+        bool sanitized = false;      // the module that was built with sanitizers
         bool signedIn = true;        // a section that asks who it is
         std::vector<std::string> devices = {"laptop", "phone"};
     };
@@ -70,6 +71,7 @@ public:
                    const std::string& device = "laptop") const;
 
     void restart(bool kill = false);
+    void killWorkers() const; // their parent starts new ones
     int port() const { return _port; }
     std::string log() const;
     std::string database() const { return _directory / "contacts.db"; }
@@ -84,6 +86,7 @@ private:
 
     test::TempDirectory _directory;
     int _port;
+    const bool _isSanitized;
     std::unique_ptr<CXRolvane> _rolvane;
     std::unique_ptr<test::ChildProcess> _process;
 };
