@@ -4,6 +4,7 @@
 
 #include <map>
 #include <mutex>
+#include <unistd.h>
 
 namespace rolvane::cardbook {
 namespace {
@@ -54,6 +55,9 @@ std::unique_ptr<Library> take(const std::string& database) {
         }
     }
     if (found && !found->isOfPast()) return found;
+    // Opening would make a new one, and every client that knows the old one would take its contacts for deleted.
+    if (access(database.c_str(), F_OK) != 0 && access(bookMemoryPath(database).c_str(), F_OK) == 0)
+        throw Refused(HTTP_INTERNAL_SERVER_ERROR, "There is no contact database " + database + " any more.");
     return std::make_unique<Library>(database);
 }
 

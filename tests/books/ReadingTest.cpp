@@ -3,6 +3,8 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <filesystem>
+
 // What a client finds and reads, by raw HTTP.
 
 namespace rolvane {
@@ -69,6 +71,16 @@ TEST(Books, AreNotServedWhereNobodyIsAsked) {
     BooksWorld world(options);
     EXPECT_EQ(world.propfind(kContacts, 1, "<D:getetag/>").status, 500);
     EXPECT_THAT(world.log(), HasSubstr("Nobody is signed in"));
+}
+
+TEST(Books, DoNotPutANewDatabaseInThePlaceOfALostOne) {
+    BooksWorld world;
+    world.addPerson("Ann", "Lee");
+    EXPECT_EQ(world.propfind(kContacts, 1, "<D:getetag/>").responses().size(), 2u);
+    for (const char* suffix : {"", "-wal", "-shm"}) std::filesystem::remove(world.database() + suffix);
+    EXPECT_EQ(world.propfind(kContacts, 1, "<D:getetag/>").status, 500) << "and no client takes it for empty";
+    EXPECT_FALSE(std::filesystem::exists(world.database()));
+    EXPECT_THAT(world.log(), HasSubstr("There is no contact database"));
 }
 
 TEST(Books, ShowEveryOwnPersonAndGroupAsACard) {
