@@ -27,17 +27,17 @@ class StoreView:
         self.requests = 0
         self.patience = 20  # seconds for one answer; httpd may owe the rest of a file that goes while it is sent
 
-    def request(self, method, path, headers=None):
+    def request(self, method, path, headers=None, body=None):
         """(status, body); the connection is kept and made again when the server closed it."""
         for attempt in (1, 2):
             if self.connection is None:
                 self.connection = http.client.HTTPSConnection(self.host, self.port, context=self.context, timeout=self.patience)
             try:
-                self.connection.request(method, path, headers={"Authorization": self.authorization, **(headers or {})})
+                self.connection.request(method, path, body=body, headers={"Authorization": self.authorization, **(headers or {})})
                 answer = self.connection.getresponse()
-                body = answer.read()
+                text = answer.read()
                 self.requests += 1
-                return answer.status, body
+                return answer.status, text
             except (http.client.HTTPException, ConnectionError, OSError):
                 self.connection.close()
                 self.connection = None

@@ -5,6 +5,7 @@ import re
 import subprocess
 import time
 
+from books import client_edits
 from steps import PASSWORD, Step, check, check_copies, records, say, sign_up, summary
 from storeview import StoreView, normal
 from world import Failure, Person, wait_until
@@ -200,6 +201,9 @@ def subscription(world, owner, endpoint, authority):
         subscriber_edits(owner, subscriber)
         subscriber.run("sync")
         check_copies(owner, subscriber, "after the subscriber's edits")
+    with Step("Clients of both people's address books edit"):
+        client_edits(world, owner, subscriber)
+        check_copies(owner, subscriber, "after the clients' edits")
     with Step("The subscriber, who may write, unsubscribes and subscribes again"):
         unsubscription(owner, subscriber, view)
     with Step("The owner takes the rights back"):
