@@ -1,6 +1,7 @@
 // The board of faults: every fault at every place that it can strike, with the real programs. See docs/reliability.md.
 
 #include "Board.h"
+#include "ClockRows.h"
 #include "DiskRows.h"
 #include "KillRows.h"
 #include "PowerRows.h"
@@ -29,6 +30,7 @@ const std::vector<Row>& rows() {
         {"twice", "a second SIGKILL, in the pass that recovers", killTwice},
         {"disk", "a full, a failing, a read-only disk at every change of a file, once and from then on", breakDisk},
         {"power", "power lost: what was synced is there, later writes in part, later names up to a moment", losePower},
+        {"clock", "the clock an hour, a day and ten years ahead and behind, for one pass", turnClock},
         {"request",
          "each request of a pass answered by 500, 503, 429, 401, 403, 404, 409, 412, 423, 507, a portal or half a "
          "document, cut, reset, not at all, or lost behind its deed",

@@ -1,0 +1,9 @@
+#pragma once
+
+#include "Board.h"
+
+namespace rolvane::board {
+
+void turnClock(Work& work);
+
+} // namespace rolvane::board
