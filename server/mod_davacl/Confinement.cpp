@@ -3,6 +3,7 @@
 #include "server/mod_davacl/Access.h"
 #include "server/mod_davacl/AclMethod.h"
 #include "server/mod_davacl/Changes.h"
+#include "server/mod_davacl/Index.h"
 #include "server/mod_davacl/PrincipalResources.h"
 #include "server/mod_davacl/TreeDirectories.h"
 
@@ -124,7 +125,7 @@ int serve(request_rec* r) {
     // A writer of a tree does not run the site, so a browser treats an uploaded page as foreign to it.
     apr_table_setn(r->headers_out, "Content-Security-Policy", "sandbox; default-src 'none'");
     apr_table_setn(r->headers_out, "X-Content-Type-Options", "nosniff");
-    for (const auto own : {servePrincipals, serveAcl, prepareChange})
+    for (const auto own : {servePrincipals, serveAcl, serveIndex, prepareChange})
         if (const int answer = own(r); answer != DECLINED) return answer;
     for (const char* module : {"mod_dav.c", "core.c"})
         if (const int answer = handOver(r, module); answer != DECLINED) return answer;

@@ -1,8 +1,8 @@
 #include "foundation/Utf8.h"
 
 #include <cstdint>
+#include <cstdio>
 #include <cstring>
-#include <fmt/format.h>
 
 namespace rolvane {
 
@@ -93,10 +93,12 @@ std::optional<std::string> xmlTextFault(std::string_view text) {
         if (text.empty()) return std::nullopt;
         const auto at = text.data() - start;
         const auto c = takeCodePoint(text);
-        if (!c) return fmt::format("it is not UTF-8 at byte {}", at);
-        if (!isXmlCharacter(*c))
-            return fmt::format("it has the character U+{:04X} at byte {}, which XML cannot carry",
-                               static_cast<uint32_t>(*c), at);
+        if (!c) return "it is not UTF-8 at byte " + std::to_string(at);
+        if (isXmlCharacter(*c)) continue;
+        char number[16];
+        std::snprintf(number, sizeof number, "U+%04X", static_cast<unsigned>(*c));
+        return std::string("it has the character ") + number + " at byte " + std::to_string(at) +
+               ", which XML cannot carry";
     }
 }
 
