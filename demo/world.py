@@ -73,6 +73,12 @@ class Person:
             raise Failure(f"`rolvane {' '.join(arguments)}` ended with {done.returncode}: {done.stderr.strip()}")
         return done.stdout
 
+    def fails(self, *arguments):
+        """Exit code and standard error of a command that may end as it likes."""
+        done = subprocess.run([self.program, *arguments], env=self.environment, input="", text=True, capture_output=True,
+                              timeout=600)
+        return done.returncode, done.stderr.strip()
+
     def json(self, *arguments, **more):
         return json.loads(self.run(*arguments, "--json", **more))
 

@@ -6,7 +6,6 @@
 #include "daemon/RetrySchedule.h"
 #include "foundation/Paths.h"
 #include "foundation/Preferences.h"
-#include "store/account/StoreTrial.h"
 #include "store/dav/CXDAVManager.h"
 
 #include <filesystem>
@@ -200,17 +199,7 @@ void testAccount(Context& context) {
                        {"published", structure},
                        {"trial", failure ? Json() : trialJson(trial)}});
     if (failure) throw CommandError(text.code, text.what + " " + text.toDo);
-    if (trial.hindrance) {
-        const int status = trial.hindrance->status;
-        const char* toDo = status == 403 || status == 401
-                               ? "Have the store's administrator let you use your own tree."
-                               : "Check the account's endpoint: it has to be a WebDAV folder for files of every kind. "
-                                 "Servers for address books or calendars alone take none.";
-        throw CommandError(status == 403 || status == 401 ? kRefused
-                           : status == 0                  ? kUnreachable
-                                                          : kFailed,
-                           trial.hindrance->what + " Nothing can be published there. " + toDo);
-    }
+    if (trial.hindrance) throw hinderedBy(*trial.hindrance, "Nothing can be published there.");
     for (const std::string& line : consequences(trial)) context.say(line);
     context.say(structure ? "The store can be used, and the account's tree is there."
                           : "The store can be used; the account has no tree there yet.");

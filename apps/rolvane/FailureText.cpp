@@ -144,6 +144,29 @@ void requireStore(const std::string& nothingDone) {
     throw CommandError(text.code, text.what + " " + text.toDo + " " + nothingDone);
 }
 
+CommandError hinderedBy(const StoreTrial::Hindrance& hindrance, const std::string& consequence) {
+    using Remedy = StoreTrial::Hindrance::Remedy;
+    const auto toDo = [&] {
+        switch (hindrance.remedy) {
+        case Remedy::rights: return "Have the store's administrator let you use your own tree.";
+        case Remedy::locks: return "Have the server's locks turned off (it announces no class 2 then), or mended.";
+        case Remedy::endpoint: break;
+        }
+        return "Check the account's endpoint: it has to be a WebDAV folder for files of every kind. Servers for "
+               "address "
+               "books or calendars alone take none.";
+    };
+    const ExitCode code = hindrance.remedy == Remedy::rights ? kRefused
+                          : hindrance.status == 0            ? kUnreachable
+                                                             : kFailed;
+    return {code, hindrance.what + " " + consequence + " " + toDo()};
+}
+
+void requireUsableStore(const std::string& nothingDone) {
+    const StoreTrial trial = tryStore(CXDAVManager::defaultManager());
+    if (trial.hindrance && trial.hindrance->lasts) throw hinderedBy(*trial.hindrance, nothingDone);
+}
+
 nlohmann::ordered_json failureJson(const PassFailure& failure, const FailureScene& scene) {
     using Json = nlohmann::ordered_json;
     const FailureText text = failureText(failure, scene);

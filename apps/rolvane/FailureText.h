@@ -3,6 +3,7 @@
 #include "Context.h"
 
 #include "engine/pass/PassOutcome.h"
+#include "store/account/StoreTrial.h"
 
 #include <optional>
 #include <string>
@@ -35,6 +36,12 @@ FailureScene sceneOfTheAccount(Date at);
 std::optional<PassFailure> testStore();
 // The same, as the error that a command ends with; `nothingDone` stands at its end.
 void requireStore(const std::string& nothingDone);
+
+// The error of a store that cannot be used; `consequence` follows the reason, as a sentence.
+CommandError hinderedBy(const StoreTrial::Hindrance& hindrance, const std::string& consequence);
+// Tries the account's store, which has been reached, as `account test` does. Throws when it is of a kind that cannot
+// be used; what may be over in a moment is left to the passes.
+void requireUsableStore(const std::string& nothingDone);
 
 nlohmann::ordered_json failureJson(const PassFailure& failure, const FailureScene& scene);
 

@@ -62,6 +62,8 @@ void publish(Context& context, const PublishOptions& options) {
         const FailureText text = failureText(*failure, sceneOfTheAccount(Clock::system().now()));
         if (text.code == kRefused)
             throw CommandError(kRefused, text.what + " " + text.toDo + " Nothing was published.");
+    } else if (!served) {
+        requireUsableStore("Nothing was published.");
     }
     removeWhatIsLeft(database, base);
 

@@ -1,4 +1,5 @@
 #include "CommandWorld.h"
+#include "FaultyStore.h"
 
 #include <arpa/inet.h>
 #include <netinet/in.h>
@@ -83,6 +84,34 @@ TEST_F(Account, NothingIsPublishedWithAWrongPassword) {
     EXPECT_TRUE(saysOnce(world.rolvane({"publish"}), kNotAllowed, "Nothing was published"));
     EXPECT_FALSE(world.json({"status"})["published"]["everything"].get<bool>());
     EXPECT_FALSE(world.daemon());
+}
+
+TEST_F(Account, NothingIsPublishedOnAStoreThatMakesNoFolders) {
+    world.makeAccount();
+    FaultyStore faulty(world);
+    ASSERT_EQ(world.rolvane(faulty.account()).status, kDone);
+    world.add("Ada");
+    faulty.set([](const FakeRequest& request) {
+        return request.method == "MKCOL" ? std::optional(FakeAnswer::status(405)) : std::nullopt;
+    });
+    EXPECT_TRUE(
+        saysOnce(world.rolvane({"publish"}), kFailure, "The store makes no folders (MKCOL was answered with 405"));
+    EXPECT_TRUE(saysOnce(world.rolvane({"publish"}), kFailure, "Nothing was published."));
+    EXPECT_FALSE(world.json({"status"})["published"]["everything"].get<bool>());
+    EXPECT_FALSE(world.daemon());
+    faulty.set({});
+    EXPECT_EQ(world.rolvane({"publish"}).status, kDone);
+}
+
+TEST_F(Account, AStoreInTroubleIsNoReasonNotToPublish) {
+    world.makeAccount();
+    FaultyStore faulty(world);
+    ASSERT_EQ(world.rolvane(faulty.account()).status, kDone);
+    faulty.set([](const FakeRequest& request) {
+        return request.method == "MKCOL" ? std::optional(FakeAnswer::status(503)) : std::nullopt;
+    });
+    EXPECT_EQ(world.rolvane({"publish", "--no-daemon"}).status, kDone);
+    EXPECT_TRUE(world.json({"status"})["published"]["everything"].get<bool>()) << "it waits";
 }
 
 TEST_F(Account, AnUnknownHostIsNotReached) {

@@ -51,6 +51,8 @@ class Server:
     files = ()  # what has to be there
     access_lists = False
     environment = {}  # of the people who use it
+    refusal = None  # of a server that cannot be used: the words by which a person is told, before anything is published
+    waits = False  # such a one may be somebody else's answer (a portal's), so a publication is noted and waits
 
     def __init__(self, directory, authority):
         self.directory, self.authority = directory, authority
@@ -137,6 +139,7 @@ class Apache(Server):
     packages = ("apache2",)
     files = ("/etc/apache2/apache2.conf", "a2enmod", "/usr/sbin/apache2")
     modules = ("dav", "dav_fs", "ssl")
+    tls = True
     recipe = """
 <Directory "{root}/dav">
     Dav On
@@ -158,6 +161,9 @@ class Apache(Server):
         # What somebody has enabled on this machine is not what is shipped.
         shutil.rmtree(os.path.join(etc, "sites-enabled"))
         os.makedirs(os.path.join(etc, "sites-enabled"))
+        encryption = f"""SSLEngine on
+    SSLCertificateFile "{self.authority.certificate}"
+    SSLCertificateKeyFile "{self.authority.key}\"""" if self.tls else ""
         environment = {**os.environ, "APACHE_CONFDIR": etc, "PATH": os.environ["PATH"] + ":/usr/sbin"}
         quiet("a2enmod", *self.modules, env=environment)
         self.file("etc/ports.conf", f"Listen 127.0.0.1:{self.port}\n")
@@ -167,9 +173,7 @@ ServerRoot "{etc}"
 DavLockDB "{self.directory}/run/DavLock"
 <VirtualHost 127.0.0.1:{self.port}>
     DocumentRoot "{self.root}"
-    SSLEngine on
-    SSLCertificateFile "{self.authority.certificate}"
-    SSLCertificateKeyFile "{self.authority.key}"
+    {encryption}
     {self.recipe.format(root=self.root, passwords=self.passwords, directory=self.directory)}
 </VirtualHost>
 """)
@@ -223,6 +227,18 @@ class ApacheSqueezing(Apache):
 """
 
 
+class ApacheCompressing(Apache):
+    """Every body comes compressed, whether it was asked for or not: proxies do that. The tag stays that of the file."""
+
+    name = "apache2 that compresses unasked"
+    modules = ("dav", "dav_fs", "ssl", "deflate", "headers")
+    recipe = Apache.recipe + """
+    RequestHeader set Accept-Encoding gzip early
+    SetOutputFilter DEFLATE
+    DeflateAlterETag NoChange
+"""
+
+
 class Nginx(Server):
     name = "nginx with dav-ext"
     packages = ("nginx", "libnginx-mod-http-dav-ext")
@@ -267,6 +283,34 @@ http {{
 }}
 """)
         return [["/usr/sbin/nginx", "-c", f"{self.directory}/nginx.conf", "-e", f"{run}/error.log"]]
+
+
+class NginxPlain(Nginx):
+    """What its package can by itself: files and folders, and neither PROPFIND nor OPTIONS."""
+
+    name = "nginx without dav-ext"
+    packages = ("nginx",)
+    files = ("/usr/sbin/nginx",)
+    modules = zones = ""
+    refusal = "is no WebDAV server"
+    waits = True
+
+    def location(self):
+        return """
+            location /dav/ {
+                dav_methods PUT DELETE MKCOL COPY MOVE;
+                client_max_body_size 100m;
+            }"""
+
+
+class NginxFolderless(Nginx):
+    """With the extension, and without MKCOL, as in many a recipe."""
+
+    name = "nginx with dav-ext, MKCOL not allowed"
+    refusal = "makes no folders"
+
+    def location(self):
+        return super().location().replace("MKCOL ", "")
 
 
 class Lighttpd(Server):
@@ -329,6 +373,22 @@ class Behind(Nginx):
             }}"""
 
 
+class ApacheBehind(Behind):
+    """Speaks plain http, knows nothing of TLS, and calls itself by its inner address."""
+
+    name = "apache2 with mod_davacl, behind nginx"
+    packages = ("apache2", "nginx")
+    files = ("/usr/sbin/nginx", *Apache.files)
+    access_lists = True
+
+    def configure(self):
+        place = os.path.join(self.directory, "apache")
+        os.makedirs(place)
+        apache = ApacheWithLists(place, self.authority)
+        apache.tls, apache.port, apache.root, apache.passwords = False, self.inner, self.root, self.passwords
+        return apache.configure() + super().configure()
+
+
 class Sabre(Behind):
     name = "PHP (php-sabre-dav by php-fpm, behind nginx)"
     packages = ("php-sabre-dav", "php8.2-fpm", "nginx")
@@ -374,12 +434,58 @@ pm.max_children = 4
 
 
 class PyWebDAV(Behind):
+    """Its LOCK fails in the middle of the answer (a status that is a text), and the lock stands for ever."""
+
     name = "python3-webdav, behind nginx"
     packages = ("python3-webdav", "nginx")
     files = ("/usr/sbin/nginx", "davserver3")
+    options = ()
+    refusal = "locks files and does not tell their locks"
 
     def configure(self):
-        return [["davserver3", "-D", self.root, "-H", "127.0.0.1", "-P", str(self.inner), "-n"]] + super().configure()
+        return [["davserver3", "-D", self.root, "-H", "127.0.0.1", "-P", str(self.inner), "-n",
+                 *self.options]] + super().configure()
+
+
+class PyWebDAVLockless(PyWebDAV):
+    name = "python3-webdav with --nolock, behind nginx"
+    options = ("--nolock",)
+    refusal = None
+
+
+class Radicale(Server):
+    """A server for address books and calendars: it takes files of no other kind."""
+
+    name = "Radicale"
+    packages = ("radicale",)
+    files = ("radicale",)
+    refusal = "takes no files of this kind"
+
+    @property
+    def endpoint(self):
+        return f"https://127.0.0.1:{self.port}/{{user}}/Contacts"
+
+    def configure(self):
+        path = self.file("radicale.conf", f"""
+[server]
+hosts = 127.0.0.1:{self.port}
+ssl = True
+certificate = {self.authority.certificate}
+key = {self.authority.key}
+[auth]
+type = htpasswd
+htpasswd_filename = {self.plain_passwords()}
+htpasswd_encryption = plain
+delay = 0
+[rights]
+type = authenticated
+[storage]
+filesystem_folder = {self.root}
+""")
+        return [["radicale", "--config", path]]
+
+    def plain_passwords(self):
+        return self.file("plain-passwords", "".join(f"{user}:{PASSWORD}\n" for user in USERS))
 
 
 class Chezdav(Behind):
@@ -494,5 +600,5 @@ simple_dc:
         return [["wsgidav", "--config", path]]
 
 
-ALL = (Apache, ApacheWithLists, ApacheSqueezing, Nginx, Lighttpd, Rclone, Sabre, PyWebDAV, Chezdav, NpmWebdavServer,
-       Nephele, Wsgidav)
+ALL = (Apache, ApacheWithLists, ApacheBehind, ApacheSqueezing, ApacheCompressing, Nginx, NginxPlain, NginxFolderless, Lighttpd, Rclone, Sabre, PyWebDAV,
+       PyWebDAVLockless, Radicale, Chezdav, NpmWebdavServer, Nephele, Wsgidav)

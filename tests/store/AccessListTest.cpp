@@ -477,6 +477,22 @@ TEST_F(StoreLists, ANameIsLookedUpInThePrincipalCollection) {
     EXPECT_NE(store.entries[1].find("/principals/carl"), std::string::npos);
 }
 
+// Behind what ends TLS a server knows itself by the inner address, and writes that into its hrefs.
+TEST_F(StoreLists, AServerMayCallItselfByAnotherAddress) {
+    store.origin = "http://127.0.0.1:8080";
+    store.entries = {AclStore::ace("/principals/carl", {"read"})};
+    EXPECT_EQ(read(), "r carl; w");
+    EXPECT_TRUE(set({"bob", "carl"}, {"bob"}));
+    EXPECT_EQ(store.lists(), "r carl bob; w bob");
+    EXPECT_EQ(store.wire->text().find("127.0.0.1"), std::string::npos) << "nobody is asked there";
+}
+
+TEST_F(StoreLists, AnotherServersPrincipalsAreNobodysHere) {
+    store.entries = {AclStore::ace("https://elsewhere.example.org/principals/carl", {"read"}),
+                     AclStore::ace("/principals/bob", {"read"})};
+    EXPECT_EQ(read(), "r bob; w");
+}
+
 TEST_F(StoreLists, WhomTheStoreDoesNotKnowIsLeftOutAndSaid) {
     EXPECT_FALSE(set({"bob", "nobody"}, {"nobody"}));
     EXPECT_EQ(store.lists(), "r bob; w");

@@ -49,10 +49,20 @@ public:
             if (auto other = instead(request)) return *other;
         const std::string path = request.url.encodedPath();
         if (request.method == "OPTIONS") return answerOf(200, {{"dav", announces}});
-        if (path.starts_with("/principals")) return principal(path, request);
-        if (request.method == "ACL") return set(path, *request.body);
-        if (request.method == "PROPFIND" && bodies.back().find("<D:acl/>") != std::string::npos) return shown(path);
+        if (path.starts_with("/principals")) return withOrigin(principal(path, request));
+        if (request.method == "ACL") return set(path, replaced(*request.body, "<D:href>" + origin + "/", "<D:href>/"));
+        if (request.method == "PROPFIND" && bodies.back().find("<D:acl/>") != std::string::npos)
+            return withOrigin(shown(path));
         return answerOf(404);
+    }
+    static std::string replaced(std::string text, const std::string& from, const std::string& to) {
+        for (size_t at = 0; (at = text.find(from, at)) != std::string::npos; at += to.size())
+            text.replace(at, from.size(), to);
+        return text;
+    }
+    HttpResponse withOrigin(HttpResponse answer) const {
+        answer.body = replaced(answer.body, "<D:href>/", "<D:href>" + origin + "/");
+        return answer;
     }
     HttpResponse shown(const std::string& path) const {
         std::string list = protectedEntries;
@@ -104,6 +114,7 @@ public:
         AclStore other(_user);
         other.entries = entries;
         other.protectedEntries = protectedEntries;
+        other.origin = origin;
         std::vector<std::string> readers, writers;
         if (!other.manager->ACLsAtURL(base, readers, writers)) return "unreadable";
         std::string out = "r";
@@ -117,6 +128,7 @@ public:
     std::string protectedEntries = "<D:ace><D:principal><D:property><D:owner/></D:property></D:principal><D:grant>"
                                    "<D:privilege><D:all/></D:privilege></D:grant><D:protected/></D:ace>";
     std::vector<std::string> entries; // as XML
+    std::string origin;               // before every path that the store writes
     std::vector<std::string> collections = {"/principals/"};
     std::map<std::string, std::string> people = {{"/principals/alice", "Alice"},
                                                  {"/principals/bob", "Bob"},

@@ -311,5 +311,61 @@ TEST(StoreTrials, SayWhatCannotWork) {
     }
 }
 
+TEST(StoreTrials, TellAServerForAddressBooksByItsOwnWords) {
+    using Remedy = StoreTrial::Hindrance::Remedy;
+    Oddities odd;
+    odd.mkcol = 403;
+    EXPECT_EQ(trialOf(odd).hindrance->remedy, Remedy::rights);
+    for (const char* announced : {"DAV: 1, 2, 3, calendar-access, extended-mkcol\r\n", "DAV: 1, addressbook\r\n"}) {
+        odd.davHeaders = announced;
+        const StoreTrial trial = trialOf(odd);
+        ASSERT_TRUE(trial.hindrance);
+        EXPECT_EQ(trial.hindrance->remedy, Remedy::endpoint);
+        EXPECT_TRUE(trial.hindrance->lasts);
+        EXPECT_NE(trial.hindrance->what.find("takes no files of this kind: it is a server for address books"),
+                  std::string::npos)
+            << trial.hindrance->what;
+    }
+    odd.mkcol = 0;
+    EXPECT_FALSE(trialOf(odd).hindrance) << "some take files, too";
+}
+
+TEST(StoreTrials, TellWhatIsOverInAMomentFromWhatLasts) {
+    for (const auto& [status, lasts] : {std::pair{403, true},
+                                        {405, true},
+                                        {501, true},
+                                        {409, true},
+                                        {423, false},
+                                        {429, false},
+                                        {500, false},
+                                        {503, false},
+                                        {507, false}}) {
+        Oddities odd;
+        odd.mkcol = status;
+        const StoreTrial trial = trialOf(odd);
+        ASSERT_TRUE(trial.hindrance) << status;
+        EXPECT_EQ(trial.hindrance->lasts, lasts) << status;
+    }
+}
+
+// As a server of Debian's does: the answer fails, and the lock stands for ever.
+TEST(StoreTrials, FindLocksThatNobodyIsTold) {
+    Oddities odd;
+    odd.lockGranted = 502;
+    for (const bool told : {false, true}) {
+        odd.tellsLocks = told;
+        OddServer server(odd);
+        OddClient alice(server);
+        CXDAVError error;
+        ASSERT_TRUE(alice.manager->canReach(error)) << error.reason;
+        const StoreTrial trial = tryStore(*alice.manager);
+        ASSERT_TRUE(trial.hindrance) << "the file stays locked";
+        const bool blamesLocks = trial.hindrance->what.find("does not tell their locks") != std::string::npos;
+        EXPECT_EQ(blamesLocks, !told) << trial.hindrance->what;
+        EXPECT_EQ(trial.hindrance->lasts, !told) << "a lock that is told was only not answered";
+        EXPECT_TRUE(server.files().empty());
+    }
+}
+
 } // namespace
 } // namespace rolvane

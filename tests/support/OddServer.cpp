@@ -203,7 +203,7 @@ std::string OddServer::entry(const std::string& path) const {
         out += "<D:getcontentlength>" + std::to_string(file.text.size()) + "</D:getcontentlength>";
         if (_odd.tags) out += "<D:getetag>" + tagOf(file) + "</D:getetag>";
     }
-    if (const auto lock = _locks.find(path); lock != _locks.end())
+    if (const auto lock = _locks.find(path); lock != _locks.end() && _odd.tellsLocks)
         out += "<D:lockdiscovery><D:activelock><D:locktoken><D:href>" + lock->second +
                "</D:href></D:locktoken></D:activelock></D:lockdiscovery>";
     return out + "</D:prop>" + (_odd.statuses ? "<D:status>HTTP/1.1 200 OK</D:status>" : "") +
@@ -242,6 +242,8 @@ FakeAnswer OddServer::transfer(const FakeRequest& request, const std::string& pa
     if (to.ends_with('/')) to.pop_back();
     if (!exists(path)) return said(404);
     if (headerOf(request, "if").find('[') != std::string::npos && _odd.ifWithTag != 0) return said(_odd.ifWithTag);
+    // As nginx: both names end with a slash, or neither does.
+    if (_odd.wantsSlash && _collections.contains(path) && !destination.ends_with('/')) return said(409);
     const bool replaces = exists(to);
     removeBelow(to);
     const auto moved = [&](const std::string& one) { return to + one.substr(path.size()); };

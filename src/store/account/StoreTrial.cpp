@@ -17,6 +17,20 @@ bool isAny(int) {
     return true;
 }
 
+// Whether a refusal says how the store is. The others may be over in a moment: a server in trouble, a full disk,
+// somebody else's lock.
+bool isLasting(int status) {
+    switch (status) {
+    case 408:
+    case 423:
+    case 425:
+    case 429: return false;
+    case 501:
+    case 505: return true;
+    default: return status >= 400 && status < 500;
+    }
+}
+
 // One trial, step by step; what it made goes with it.
 class Trial {
 public:
@@ -30,13 +44,13 @@ public:
     StoreTrial run() {
         _found.accessLists = _session.keepsAccessLists().value_or(false);
         if (makesFolders() && takesFiles() && readsAndLists()) {
-            triesLocks();
-            if (changes()) deletes();
+            if (triesLocks() && changes()) deletes();
         }
         return _found;
     }
 
 private:
+    using Remedy = StoreTrial::Hindrance::Remedy;
     using Headers = std::vector<std::pair<std::string, std::string>>;
 
     HttpResponse ask(const char* method, const Url& url, Headers headers = {}, const std::string& body = {}) {
@@ -55,15 +69,28 @@ private:
                                      ? std::string(method) + " was answered with " + std::to_string(answer.status)
                                      : answer.detail;
         const std::string words = answer.complete() ? serverWords(answer) : std::string();
-        _found.hindrance = {what + " (" + said + (words.empty() ? "" : ": " + words) + ").",
-                            answer.complete() ? answer.status : 0};
+        const int status = answer.complete() ? answer.status : 0;
+        const bool isDenied = status == 403 || status == 401;
+        _found.hindrance = {what + " (" + said + (words.empty() ? "" : ": " + words) + ").", status, isLasting(status),
+                            isDenied ? Remedy::rights : Remedy::endpoint};
+        return false;
+    }
+    // A server for address books and calendars refuses other things as it refuses strangers: by 403, or 400.
+    bool refused(const std::string& what, const char* method, const HttpResponse& answer) {
+        const HttpResponse options = ask("OPTIONS", _made.empty() ? _tree : _made.front());
+        const bool isForBooks =
+            announcesDavClass(options, "addressbook") || announcesDavClass(options, "calendar-access");
+        if (!isForBooks || !answer.complete() || !isLasting(answer.status)) return hindered(what, method, answer);
+        hindered("The store takes no files of this kind: it is a server for address books or calendars", method,
+                 answer);
+        _found.hindrance->remedy = Remedy::endpoint;
         return false;
     }
 
     bool makesFolders() {
         const CXDAVAccount& account = _session.account();
         const Url name = account.baseLocationFor(account.user);
-        const Url tree = *_session.collectionEndpoint(name, true);
+        const Url tree = _tree = *_session.collectionEndpoint(name, true);
         HttpResponse made = ask("MKCOL", tree);
         if (made.status == 409 || made.status == 404) { // the folders above it are missing
             std::vector<Url> above;
@@ -77,7 +104,7 @@ private:
         if (made.ok()) _made.push_back(tree);
         const Url folder = namedAsCollection(tree.cxURLByAppendingComponent("trial-" + makeUUID()));
         made = ask("MKCOL", folder);
-        if (!made.ok()) return hindered("The store makes no folders", "MKCOL", made);
+        if (!made.ok()) return refused("The store makes no folders", "MKCOL", made);
         _made.push_back(folder);
         _file = folder.cxURLByAppendingComponent(makeUUID() + ":CXPerson");
         return true;
@@ -85,7 +112,7 @@ private:
 
     bool takesFiles() {
         const HttpResponse written = put("first");
-        return written.ok() || hindered("The store takes no files of this kind", "PUT", written);
+        return written.ok() || refused("The store takes no files of this kind", "PUT", written);
     }
 
     bool readsAndLists() {
@@ -105,19 +132,42 @@ private:
         return hindered("The store does not list what was written", "PROPFIND", listed);
     }
 
-    void triesLocks() {
-        if (!_session.mayKeepLocks()) return;
-        const HttpResponse answer = ask(
-            "LOCK", _file,
-            {{"Depth", "0"}, {"Timeout", "Second-60"}, {"Content-Type", "application/xml; charset=utf-8"}},
-            "<?xml version=\"1.0\" encoding=\"utf-8\"?>\n<lockinfo xmlns=\"DAV:\"><lockscope><exclusive/></lockscope>"
-            "<locktype><write/></locktype><owner>trial</owner></lockinfo>");
+    HttpResponse lock() {
+        return ask("LOCK", _file,
+                   {{"Depth", "0"}, {"Timeout", "Second-60"}, {"Content-Type", "application/xml; charset=utf-8"}},
+                   "<?xml version=\"1.0\" encoding=\"utf-8\"?>\n<lockinfo xmlns=\"DAV:\"><lockscope><exclusive/>"
+                   "</lockscope><locktype><write/></locktype><owner>trial</owner></lockinfo>");
+    }
+
+    bool tellsLocks() {
+        const HttpResponse answer =
+            ask("PROPFIND", _file, {{"Depth", "0"}, {"Content-Type", "application/xml; charset=utf-8"}},
+                "<?xml version=\"1.0\" encoding=\"utf-8\"?>\n<propfind xmlns=\"DAV:\"><prop><lockdiscovery/></prop>"
+                "</propfind>");
+        const auto locks = answer.status == 207 ? parseLockDiscovery(answer.body) : std::nullopt;
+        return locks && !locks->empty();
+    }
+
+    // False only where a lock stands behind an answer that does not grant one: then every lock is the last.
+    bool triesLocks() {
+        if (!_session.mayKeepLocks()) return true;
+        const HttpResponse answer = lock();
         const auto grant = answer.ok() ? parseLockAnswer(answer.body) : std::nullopt;
         const std::string token = grant ? grant->token.str() : std::string();
-        if (token.empty() || token.find_first_of("<>\r\n ") != std::string::npos) return;
+        if (token.empty() || token.find_first_of("<>\r\n ") != std::string::npos) {
+            if (answer.complete() && answer.status < 500 && !answer.ok()) return true;
+            const HttpResponse second = lock();
+            if (second.status != 423 || tellsLocks()) return true;
+            hindered("The store locks files and does not tell their locks: what is locked stays so", "A second LOCK",
+                     second);
+            _found.hindrance->lasts = true;
+            _found.hindrance->remedy = Remedy::locks;
+            return false;
+        }
         const bool written = put("locked", {{"If", "<" + _file.absoluteString() + "> (<" + token + ">)"}}).ok();
         const bool released = ask("UNLOCK", _file, {{"Lock-Token", "<" + token + ">"}}).ok();
         _found.locks = written && released;
+        return true;
     }
 
     bool changes() {
@@ -144,7 +194,7 @@ private:
     StoreSession& _session;
     StoreTrial _found;
     std::vector<Url> _made; // from the outside in
-    Url _file;
+    Url _tree, _file;
 };
 
 } // namespace

@@ -14,6 +14,8 @@ struct StoreTrial {
     struct Hindrance {
         std::string what;
         int status = 0;
+        bool lasts = false; // the store is like that: another attempt will meet it, too
+        enum class Remedy { endpoint, rights, locks } remedy = Remedy::endpoint; // where to look
     };
     std::optional<Hindrance> hindrance;
 

@@ -121,7 +121,7 @@ std::optional<StoreAccessLists::OnStore> StoreAccessLists::fetch(const Url& endp
     OnStore found;
     const CXDAVNode* href = response.firstChild("href");
     found.asked = href && href->content().ends_with('/') ? namedAsCollection(endpoint) : endpoint;
-    found.principals = std::make_shared<StorePrincipals>(_session, endpoint,
+    found.principals = std::make_shared<StorePrincipals>(_session, endpoint, href ? href->content() : std::string(),
                                                          hrefsIn(davProperty(response, "principal-collection-set")));
     const auto owners = hrefsIn(davProperty(response, "owner"));
     if (!owners.empty()) found.owner = owners.front();

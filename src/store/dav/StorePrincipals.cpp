@@ -25,8 +25,12 @@ bool isPrincipal(const CXDAVNode& response) {
 
 } // namespace
 
-StorePrincipals::StorePrincipals(StoreSession& session, Url asked, const std::vector<std::string>& collections)
+StorePrincipals::StorePrincipals(StoreSession& session, Url asked, const std::string& itself,
+                                 const std::vector<std::string>& collections)
     : _session(session), _asked(std::move(asked)) {
+    if (const auto url = Url::parse(itself);
+        url && !url->host().empty() && url->pathComponents() == _asked.pathComponents())
+        _innerOrigin = url->origin();
     for (const std::string& href : collections)
         if (const auto url = resolved(href)) _collections.push_back(*url);
 }
@@ -34,8 +38,9 @@ StorePrincipals::StorePrincipals(StoreSession& session, Url asked, const std::ve
 std::optional<Url> StorePrincipals::resolved(const std::string& href) const {
     if (href.starts_with("//")) return std::nullopt;
     const auto url = Url::parse(href.starts_with('/') ? _asked.origin() + href : href);
-    if (!url || url->host().empty() || url->origin() != _asked.origin()) return std::nullopt;
-    return url;
+    if (!url || url->host().empty()) return std::nullopt;
+    if (url->origin() == _asked.origin()) return url;
+    return url->origin() == _innerOrigin ? Url::parse(_asked.origin() + url->encodedPath()) : std::nullopt;
 }
 
 std::string StorePrincipals::nameFor(const std::string& href) const {

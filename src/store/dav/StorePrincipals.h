@@ -14,9 +14,11 @@ namespace rolvane {
 // names the collections that principals lie in; asks the store for what it does not know. One thread.
 class StorePrincipals {
 public:
-    // `asked` is the endpoint that was asked; hrefs are relative to it, and those of other origins are not looked at.
-    // `collections`: the hrefs of DAV:principal-collection-set.
-    StorePrincipals(StoreSession& session, Url asked, const std::vector<std::string>& collections);
+    // `asked` is the endpoint that was asked; hrefs are relative to it. `itself` is what the answer calls that: a server
+    // behind what ends TLS writes its inner address, whose hrefs then count by their paths. Those of other origins are
+    // not looked at. `collections`: the hrefs of DAV:principal-collection-set.
+    StorePrincipals(StoreSession& session, Url asked, const std::string& itself,
+                    const std::vector<std::string>& collections);
 
     // The last component of the principal's path; "" when the href names nobody on this store.
     std::string nameFor(const std::string& href) const;
@@ -36,6 +38,7 @@ private:
 
     StoreSession& _session;
     const Url _asked;
+    std::string _innerOrigin; // "" where the server has no other address
     std::vector<Url> _collections;
     std::map<std::string, std::string> _known;
 };

@@ -500,13 +500,19 @@ bool StoreFiles::moveIntoCollection(const Url& url, const EntityTag& tag) {
     move.headers = {{"Destination", url.absoluteString()}, {"Overwrite", "T"}};
     const HttpRequest unconditional = move;
     if (!tag.empty()) move.headers.emplace_back("If", taggedCondition(url, "[" + tag.str() + "]"));
-    HttpResponse moved = _session.send(std::move(move), isAny);
+    HttpResponse moved = _session.send(move, isAny);
     if (moved.ok()) return true;
     EntityTag now;
-    const Kind kind =
-        isGoneOrChanged(moved.status) || mayMeanTheCondition(moved.status) ? kindOf(url, &now) : Kind::unknown;
+    const bool wantsSlash = moved.status == 409; // nginx: to the name of a collection, which ends with one
+    const bool isLookedAt = wantsSlash || isGoneOrChanged(moved.status) || mayMeanTheCondition(moved.status);
+    const Kind kind = isLookedAt ? kindOf(url, &now) : Kind::unknown;
     // One that was sent again because its answer was lost finds the collection in its place.
     if (kind == Kind::collection) return true;
+    if (kind == Kind::file && wantsSlash && (tag.empty() || isOneVersion(tag, now))) {
+        move.headers.front().second = namedAsCollection(url).absoluteString();
+        moved = _session.send(std::move(move), isAny);
+        if (moved.ok()) return true;
+    }
     if (kind == Kind::file && mayMeanTheCondition(moved.status) && isOneVersion(tag, now)) {
         moved = _session.send(unconditional, isAny); // the server gets the condition wrong
         if (moved.ok()) return true;
