@@ -123,7 +123,7 @@ const char* sourceName(PasswordSource::Kind kind) {
 
 void showAccount(Context& context) {
     const auto account = savedAccount();
-    if (!account) throw CommandError(kNotFound, "There is no account on a store yet. `rolvane account set` makes one.");
+    if (!account) throw noAccount();
     const char* authentication = account->authentication == Authentication::basic    ? "basic"
                                  : account->authentication == Authentication::digest ? "digest"
                                                                                      : "automatic";
@@ -184,7 +184,7 @@ Json trialJson(const StoreTrial& trial) {
 // step, 6 for a store that is not reached, 1 for one that cannot be used.
 void testAccount(Context& context) {
     const auto account = savedAccount();
-    if (!account) throw CommandError(kNotFound, "There is no account on a store yet. `rolvane account set` makes one.");
+    if (!account) throw noAccount();
     requirePassword(*account);
     const auto failure = testStore();
     const bool structure = !failure && CXDAVManager::defaultManager().sanityCheckPublishStructureCreate(false);

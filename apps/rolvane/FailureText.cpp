@@ -53,7 +53,8 @@ FailureText unanswered(const PassFailure& failure, const FailureScene& scene) {
     case kCXDAVErrorNoPassword:
         return {kRefused, fmt::format("The password of \"{}\" cannot be had{}.", scene.self, quoted(failure.words)),
                 "`rolvane account test` says why, `rolvane account set --ask-password` takes it anew."};
-    case kCXDAVErrorNoAccount: return {kFailed, "There is no account on a store.", "`rolvane account set` makes one."};
+    case kCXDAVErrorNoAccount:
+        return {kNotFound, "There is no account on a store.", "`rolvane account set` makes one."};
     case kCXDAVErrorCannotConnect: {
         const bool unknownName = failure.words.find("resolve") != std::string::npos;
         return {kUnreachable, fmt::format("{} cannot be reached{}.", store, quoted(failure.words)),
@@ -118,6 +119,10 @@ FailureText failureText(const PassFailure& failure, const FailureScene& scene) {
                 "The daemon tries again by itself. If it goes on, the store's administrator finds the reason in its "
                 "log."};
     return {kFailed, answered(""), kByItself};
+}
+
+CommandError noAccount() {
+    return {kNotFound, "There is no account on a store yet. `rolvane account set` makes one."};
 }
 
 FailureScene sceneOfTheAccount(Date at) {

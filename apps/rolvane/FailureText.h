@@ -29,6 +29,9 @@ struct FailureScene {
 // The one table from a store's answers to advice. Pure.
 FailureText failureText(const PassFailure& failure, const FailureScene& scene);
 
+// The one error of a command that needs the account and finds none.
+CommandError noAccount();
+
 // The account's store and user; without an account both are empty.
 FailureScene sceneOfTheAccount(Date at);
 

@@ -1,5 +1,6 @@
 #include "Passes.h"
 
+#include "FailureText.h"
 #include "PassReport.h"
 #include "Publication.h"
 
@@ -44,8 +45,7 @@ Url ownBase() {
         throw CommandError(kRefused, error.reason());
     }
     const std::string user = CXDAVManager::vaultraUser();
-    if (user.empty())
-        throw CommandError(kFailed, "There is no account on a store yet. `rolvane account set` makes one.");
+    if (user.empty()) throw noAccount();
     return CXDAVManager::ostrelBaseLocationForOstrelUser(UserName(user));
 }
 

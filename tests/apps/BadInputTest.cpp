@@ -85,6 +85,33 @@ TEST_F(BadInput, StandardInputIsImportedToo) {
     EXPECT_TRUE(bad.errors.starts_with("standard input:1: ")) << bad;
 }
 
+// A pipe has neither a length nor a second reading: what kind of file it is has to be told from what has come.
+TEST_F(BadInput, TablesComeThroughAPipeToo) {
+    std::string csv = "First Name,Last Name,E-mail Address,Notes\n";
+    for (int i = 0; i < 3000; ++i)
+        csv += "Ann" + std::to_string(i) + ",Byron,a" + std::to_string(i) + "@example.org,\"two\nlines, and " +
+               std::string(60, 'x') + "\"\n";
+    const std::string file = world.write("people.csv", csv);
+    const std::string rolvane = "'" + UserWorld::rolvaneProgram() + "' import -q --json ";
+    // In two pieces, the first of which ends within a line.
+    const Ran piped =
+        world.run({"sh", "-c", "{ head -c 70001 '" + file + "'; tail -c +70002 '" + file + "'; } | " + rolvane + "-"});
+    ASSERT_EQ(piped.status, kDone) << piped;
+    EXPECT_EQ(nlohmann::json::parse(piped.output)["imported"], 3000) << piped;
+    const std::string fifo = "'" + (world.home / "fifo.csv") + "'";
+    const Ran named =
+        world.run({"sh", "-c", "mkfifo " + fifo + " && { cat '" + file + "' > " + fifo + " & } && " + rolvane + fifo});
+    ASSERT_EQ(named.status, kDone) << named;
+    EXPECT_EQ(nlohmann::json::parse(named.output)["imported"], 0) << named;
+    EXPECT_EQ(nlohmann::json::parse(named.output)["unchanged"], 3000) << named;
+    const Ran ldif = world.run(
+        {"sh", "-c",
+         "printf 'dn: cn=Grace\\nobjectclass: person\\ncn: Grace Hopper\\nsn: Hopper\\nmail: g@example.org\\n' | " +
+             rolvane + "-"});
+    ASSERT_EQ(ldif.status, kDone) << ldif;
+    EXPECT_EQ(nlohmann::json::parse(ldif.output)["imported"], 1) << ldif;
+}
+
 TEST_F(BadInput, AHundredMegabytesOfOneLineAreLeftOutAndTheirCardGoesIn) {
     const std::string path = world.home / "endless.vcf";
     {

@@ -211,6 +211,20 @@ TEST(VCardForeign, KeptLinesAreWrittenAsEachVersionHasThem) {
     expectComesBack(e);
 }
 
+TEST(VCardForeign, APlaceIsAPairInOneVersionAndAURIInTheOther) {
+    for (const auto& [version, written] : {std::pair{"3.0", "GEO:12.5;-42.25"}, {"4.0", "GEO:geo:12.5,-42.25"}}) {
+        auto e = readOneCard("FN:x\r\n" + std::string(written) + "\r\n", version);
+        EXPECT_TRUE(contains(vcardText(e, VCardVersion::v3), "\r\nGEO:12.5;-42.25\r\n")) << written;
+        EXPECT_TRUE(contains(vcardText(e, VCardVersion::v4), "\r\nGEO:geo:12.5,-42.25\r\n")) << written;
+    }
+    for (const char* more : {"geo:12.5,-42.25,7", "geo:12.5,-42.25;u=3", "nowhere;else"}) {
+        auto e = readOneCard("FN:x\r\nGEO:" + std::string(more) + "\r\n", "4.0");
+        EXPECT_TRUE(contains(vcardText(e, VCardVersion::v4), "\r\nGEO:" + std::string(more) + "\r\n")) << more;
+    }
+    const auto high = readOneCard("FN:x\r\nGEO:geo:12.5,-42.25,7\r\n", "4.0");
+    EXPECT_FALSE(contains(vcardText(high, VCardVersion::v3), "\r\nGEO:")) << "3.0 has no altitude";
+}
+
 TEST(VCardForeign, ABirthdayWithoutItsYearIsADayOfTheYear) {
     for (const char* line : {"BDAY:--0517", "BDAY;VALUE=date:--05-17"}) {
         auto e = readOneCard(std::string("FN:x\r\n") + line + "\r\n", "3.0");

@@ -52,6 +52,7 @@ class Server:
     access_lists = False
     environment = {}  # of the people who use it
     refusal = None  # of a server that cannot be used: the words by which a person is told, before anything is published
+    absent = ""  # why it may be missing
     waits = False  # such a one may be somebody else's answer (a portal's), so a publication is noted and waits
 
     def __init__(self, directory, authority):
@@ -576,6 +577,7 @@ class Wsgidav(Server):
 
     name = "wsgidav"
     files = ("wsgidav",)
+    absent = "; Debian 12 has no package of it"
 
     @classmethod
     def version(cls):

@@ -243,9 +243,14 @@ void VCardImport::takeGroup(VCardEntity&& card, const std::string& file) {
 
 CXRecordRef VCardImport::recordForUID(const std::string& uid, std::string_view table) const {
     std::string uuid = vcardUUIDForUID(uid);
-    // References to a UUID may be spelt in the other letter case than the record.
-    for (const std::string& spelling : {uuid, vcardUpper(uuid), vcardLower(uuid)})
-        if (auto record = _rolvane.recordForUniqueId(UniqueId(spelling + ":" + std::string(table)))) return record;
+    const auto named = [&](const std::string& spelling) {
+        return _rolvane.recordForUniqueId(UniqueId(spelling + ":" + std::string(table)));
+    };
+    if (auto record = named(uuid)) return record;
+    // References to a UUID may be spelt in the other letter case than the record. Each look-up costs two statements.
+    for (const std::string& other : {vcardUpper(uuid), vcardLower(uuid)})
+        if (other != uuid)
+            if (auto record = named(other)) return record;
     return nullptr;
 }
 

@@ -139,6 +139,22 @@ bool makeMediaUniform(VCardLine& line, const Media& media) {
     return true;
 }
 
+// Two numbers with a separator between them, joined by another one: "12.5;42.25" -> "12.5,42.25". Nothing when the text
+// is anything else.
+std::optional<std::string> rejoinedNumbers(std::string_view text, char separator, char other) {
+    const size_t at = text.find(separator);
+    const auto isNumber = [](std::string_view number) {
+        return number.find_first_of("0123456789") != std::string_view::npos &&
+               number.find_first_not_of("-.0123456789") == std::string_view::npos;
+    };
+    if (at == std::string_view::npos || !isNumber(text.substr(0, at)) || !isNumber(text.substr(at + 1)))
+        return std::nullopt;
+    return std::string(text.substr(0, at)) + other + std::string(text.substr(at + 1));
+}
+
+// A place is a pair of numbers in 3.0 (RFC 2426 section 3.4.2), and a URI in 4.0 (RFC 6350 section 6.5.2).
+constexpr std::string_view kGeoScheme = "geo:";
+
 // Properties that vCard 4.0 has given up, and those of which a card has one, which is written elsewhere.
 bool isForeignTo(std::string_view name, bool version4) {
     for (std::string_view once : {"FN", "N", "BDAY", "KIND"})
@@ -161,6 +177,8 @@ std::optional<VCardLine> vcardKeptForm(VCardLine line) {
     }
     if (const Media* media = mediaOf(line))
         if (!makeMediaUniform(line, *media)) return std::nullopt;
+    if (line.name == "GEO" && !line.parameter("VALUE"))
+        if (const auto place = rejoinedNumbers(line.value, ';', ',')) line.value = std::string(kGeoScheme) + *place;
     return line;
 }
 
@@ -183,6 +201,11 @@ std::optional<VCardLine> vcardKeptLineFor(const VCardLine& kept, bool version4) 
         line.parameters.insert(line.parameters.begin(), {{"ENCODING", {"b"}}, {"TYPE", types}});
     } else if (media && line.value.starts_with("data:")) {
         return std::nullopt; // of a kind that has no other spelling
+    }
+    if (line.name == "GEO" && line.value.starts_with(kGeoScheme)) {
+        const auto place = rejoinedNumbers(std::string_view(line.value).substr(kGeoScheme.size()), ',', ';');
+        if (!place) return std::nullopt; // with an altitude, or an uncertainty
+        line.value = *place;
     }
     if (line.firstValueOf("PREF") == "1") {
         remove(line, "PREF");
