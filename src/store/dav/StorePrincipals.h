@@ -14,9 +14,9 @@ namespace rolvane {
 // names the collections that principals lie in; asks the store for what it does not know. One thread.
 class StorePrincipals {
 public:
-    // `asked` is the endpoint that was asked; hrefs are relative to it. `itself` is what the answer calls that: a server
-    // behind what ends TLS writes its inner address, whose hrefs then count by their paths. Those of other origins are
-    // not looked at. `collections`: the hrefs of DAV:principal-collection-set.
+    // `asked` is the endpoint that was asked; hrefs are relative to it. `itself` is what the answer calls that: a
+    // server behind what ends TLS writes its inner address, whose hrefs then count by their paths. Those of other
+    // origins are not looked at. `collections`: the hrefs of DAV:principal-collection-set.
     StorePrincipals(StoreSession& session, Url asked, const std::string& itself,
                     const std::vector<std::string>& collections);
 
