@@ -73,6 +73,7 @@ bench:
 	cmake --build --preset bench -j$(JOBS)
 	bench/run build/bench
 	bench/longlist.py build/bench
+	bench/signin.py build/bench
 
 lint:
 	@packaging/setup build test lint

@@ -120,6 +120,15 @@ const char* setSlows(cmd_parms* cmd, void*, int on) {
     return nullptr;
 }
 
+const char* setNewcomers(cmd_parms* cmd, void*, const char* text) {
+    int& into = ofServer(cmd->server)->newcomers;
+    if (std::strcmp(text, "0") == 0) {
+        into = 0;
+        return nullptr;
+    }
+    return readNumber(text, 100000, into) ? nullptr : "the number of connections must be from 0 to 100000";
+}
+
 // AP_INIT_* want the one type of function in a union that C++ will not convert to.
 template <class Function>
 cmd_func asCommand(Function function) {
@@ -170,6 +179,11 @@ const char* lastUseDirectoryOf(const request_rec* r) {
     return c ? c->lastUse : nullptr;
 }
 
+int mostNewcomers(const server_rec* server) {
+    const Configuration* c = ofServer(server);
+    return c && c->newcomers > 0 ? c->newcomers : 0;
+}
+
 bool parksConnections(const server_rec* server) {
     const Configuration* c = ofServer(server);
     return c && c->parks > 0;
@@ -195,6 +209,7 @@ void* mergeConfigurations(apr_pool_t* pool, void* base, void* more) {
     if (inner->slows >= 0) merged->slows = inner->slows;
     if (inner->strict >= 0) merged->strict = inner->strict;
     if (inner->parks >= 0) merged->parks = inner->parks;
+    if (inner->newcomers >= 0) merged->newcomers = inner->newcomers;
     if (inner->depth) merged->depth = inner->depth;
     if (inner->entries) merged->entries = inner->entries;
     return merged;
@@ -282,6 +297,8 @@ const command_rec kDirectives[] = {
      "whether passwords are not looked at for a while after wrong ones from the same address: Off by default"},
     {"DavAclLastUse", asCommand(setLastUse), nullptr, RSRC_CONF, TAKE1,
      "a directory in which the date of the file with a user's name tells when that user signed in last"},
+    {"DavAclNewcomers", asCommand(setNewcomers), nullptr, RSRC_CONF, TAKE1,
+     "how many connections of one address, in one process, may be silent without a sign-in: 0, no bound, by default"},
     {"DavAclMaxEntries", asCommand(setMaxEntries), nullptr, RSRC_CONF, TAKE1,
      "how many entries a list may hold: 1000 by default"},
     {"DavAclDepth", asCommand(setDepth), nullptr, RSRC_CONF, TAKE1,

@@ -17,6 +17,7 @@ struct Configuration {
     int strict = -1;                     // whether a way around the lists keeps httpd from starting; -1: not said
     int parks = -1;                      // whether silent connections wait without a thread; -1: not said
     int slows = -1;                      // whether guesses of passwords are slowed down; -1: not said
+    int newcomers = -1;                  // -1: not said
     int depth = 0;                       // how many segments below the base may have lists of their own
 
     bool isStrict() const { return strict != 0; }
@@ -35,6 +36,7 @@ bool slowsGuesses(const request_rec* r);
 const char* lastUseDirectoryOf(const request_rec* r);
 // DavAclParkConnections, of the host that the connection came to.
 bool parksConnections(const server_rec* server);
+int mostNewcomers(const server_rec* server); // 0: no bound
 
 void* createConfiguration(apr_pool_t* pool, server_rec* server);
 void* mergeConfigurations(apr_pool_t* pool, void* base, void* more);

@@ -6,6 +6,7 @@
 #include "server/mod_davacl/Confinement.h"
 #include "server/mod_davacl/Enforcement.h"
 #include "server/mod_davacl/LiveProperties.h"
+#include "server/mod_davacl/Newcomers.h"
 #include "server/mod_davacl/Parking.h"
 #include "server/mod_davacl/Passwords.h"
 #include "server/mod_davacl/PrincipalResources.h"
@@ -30,6 +31,11 @@ void registerHooks(apr_pool_t* pool) noexcept {
     ap_hook_post_config(checkConfigurations, nullptr, nullptr, APR_HOOK_MIDDLE);
     ap_hook_post_perdir_config(confine, nullptr, nullptr, APR_HOOK_MIDDLE);
     ap_hook_handler(serveConfined, nullptr, nullptr, APR_HOOK_REALLY_FIRST - 10);
+    ap_hook_child_init(watchNewcomers, nullptr, nullptr, APR_HOOK_MIDDLE);
+    ap_hook_process_connection(noteConnection, nullptr, nullptr, APR_HOOK_REALLY_FIRST - 1);
+    ap_hook_post_read_request(noteRequest, nullptr, nullptr, APR_HOOK_REALLY_FIRST);
+    ap_hook_fixups(noteSignIn, nullptr, nullptr, APR_HOOK_REALLY_FIRST - 1);
+    ap_hook_log_transaction(noteAnswer, nullptr, nullptr, APR_HOOK_REALLY_FIRST);
     ap_hook_process_connection(parkSilent, nullptr, nullptr, APR_HOOK_REALLY_FIRST);
     ap_hook_fixups(enforce, nullptr, nullptr, APR_HOOK_REALLY_FIRST);
     ap_hook_handler(servePrincipals, nullptr, beforeDav, APR_HOOK_FIRST);
@@ -43,6 +49,7 @@ void registerHooks(apr_pool_t* pool) noexcept {
     dav_register_liveprop_group(pool, &kLiveProperties);
     dav_options_provider_register(pool, "davacl", const_cast<dav_options_provider*>(&kOptions));
     registerChangeFilters();
+    registerParking();
     registerPasswords(pool);
 }
 

@@ -21,8 +21,18 @@ constexpr size_t kLongestHead = 8000;
 // What mod_ssl returns when the handshake waits for the client: OpenSSL's number, not one of APR's.
 constexpr apr_status_t kHandshakeWantsRead = 2;
 
-struct Seen {
-    size_t bytes = 0; // of a head that is not whole yet
+constexpr const char* kGiveBack = "DAVACL-HEAD";
+
+// What was read of a connection's next head. It is kept here, because behind a TLS record that is only looked at the
+// next one is not seen, and its bytes may have left the socket already: the connection would wait for what is here. The
+// filter kGiveBack, once it is in, gives it to whoever reads.
+struct Head {
+    char* text = nullptr; // kLongestHead bytes of the connection's pool
+    size_t at = 0, end = 0;
+    ap_filter_t* filter = nullptr;
+
+    std::string_view rest() const { return {text + at, end - at}; }
+    bool isEmpty() const { return at == end; }
 };
 
 #ifdef AP_MPMQ_CAN_WAITIO
@@ -73,38 +83,57 @@ int lookAtPlain(conn_rec* c) {
     return park(c);
 }
 
-std::string textOf(apr_bucket_brigade* brigade) {
-    std::string text;
-    for (apr_bucket* b = APR_BRIGADE_FIRST(brigade); b != APR_BRIGADE_SENTINEL(brigade); b = APR_BUCKET_NEXT(b)) {
-        const char* part = nullptr;
-        apr_size_t length = 0;
-        if (!APR_BUCKET_IS_METADATA(b) && apr_bucket_read(b, &part, &length, APR_NONBLOCK_READ) == APR_SUCCESS)
-            text.append(part, length);
+// Reads what is here, at most as much as a head may have. EAGAIN when more may come.
+apr_status_t readMore(conn_rec* c, Head& head) {
+    apr_bucket_brigade* brigade = apr_brigade_create(c->pool, c->bucket_alloc);
+    apr_status_t status = APR_SUCCESS;
+    while (status == APR_SUCCESS && head.end < kLongestHead) {
+        status = ap_get_brigade(head.filter->next, brigade, AP_MODE_READBYTES, APR_NONBLOCK_READ,
+                                static_cast<apr_off_t>(kLongestHead - head.end));
+        apr_size_t count = kLongestHead - head.end;
+        if (status == APR_SUCCESS) status = apr_brigade_flatten(brigade, head.text + head.end, &count);
+        if (status == APR_SUCCESS && count == 0) status = APR_EAGAIN;
+        if (status == APR_SUCCESS) head.end += count;
+        apr_brigade_cleanup(brigade);
     }
-    return text;
+    apr_brigade_destroy(brigade);
+    return status;
 }
 
-int lookAtTLS(conn_rec* c, Seen& seen) {
+int lookAtTLS(conn_rec* c, Head& head) {
     apr_bucket_brigade* brigade = apr_brigade_create(c->pool, c->bucket_alloc);
-    apr_status_t status = ap_get_brigade(c->input_filters, brigade, AP_MODE_INIT, APR_NONBLOCK_READ, 0);
-    if (status == kHandshakeWantsRead || APR_STATUS_IS_EAGAIN(status)) {
-        apr_brigade_destroy(brigade);
-        return park(c);
-    }
-    if (status != APR_SUCCESS) {
-        apr_brigade_destroy(brigade);
-        return DECLINED;
-    }
-    apr_brigade_cleanup(brigade);
-    status = ap_get_brigade(c->input_filters, brigade, AP_MODE_SPECULATIVE, APR_NONBLOCK_READ, kLongestHead);
-    const std::string text = status == APR_SUCCESS ? textOf(brigade) : std::string();
+    const apr_status_t status = ap_get_brigade(c->input_filters, brigade, AP_MODE_INIT, APR_NONBLOCK_READ, 0);
     apr_brigade_destroy(brigade);
-    if (APR_STATUS_IS_EAGAIN(status) || (status == APR_SUCCESS && text.empty())) return park(c);
-    if (status != APR_SUCCESS || isWholeHead(text)) return DECLINED;
-    // A second record is not seen behind the first one: who sends a head in pieces waits once, and is read then.
-    if (seen.bytes) return DECLINED;
-    seen.bytes = text.size();
-    return park(c);
+    if (status == kHandshakeWantsRead || APR_STATUS_IS_EAGAIN(status)) return park(c);
+    if (status != APR_SUCCESS) return DECLINED;
+    if (!head.filter) {
+        head.text = static_cast<char*>(apr_palloc(c->pool, kLongestHead));
+        head.filter = ap_add_input_filter(kGiveBack, &head, nullptr, c);
+        if (!head.filter) return DECLINED;
+    }
+    if (head.isEmpty()) head.at = head.end = 0;
+    const apr_status_t more = readMore(c, head);
+    if ((more != APR_SUCCESS && !APR_STATUS_IS_EAGAIN(more)) || isWholeHead(head.rest())) return DECLINED;
+    return head.end < kLongestHead ? park(c) : DECLINED;
+}
+
+apr_status_t giveBack(ap_filter_t* filter, apr_bucket_brigade* brigade, ap_input_mode_t mode, apr_read_type_e block,
+                      apr_off_t wanted) noexcept {
+    auto& head = *static_cast<Head*>(filter->ctx);
+    if (mode == AP_MODE_EATCRLF)
+        while (!head.isEmpty() && (head.text[head.at] == '\r' || head.text[head.at] == '\n')) ++head.at;
+    if (mode == AP_MODE_INIT || head.isEmpty()) return ap_get_brigade(filter->next, brigade, mode, block, wanted);
+    if (mode == AP_MODE_EATCRLF) return APR_SUCCESS;
+    const std::string_view rest = head.rest();
+    size_t count = rest.size();
+    if (mode == AP_MODE_GETLINE)
+        count = std::min(rest.find('\n'), rest.size() - 1) + 1; // a line that ends later is asked for again
+    else if (mode != AP_MODE_EXHAUSTIVE && wanted >= 0)
+        count = std::min(count, static_cast<size_t>(wanted));
+    apr_bucket* bucket = apr_bucket_heap_create(rest.data(), count, nullptr, filter->c->bucket_alloc);
+    APR_BRIGADE_INSERT_TAIL(brigade, bucket);
+    if (mode != AP_MODE_SPECULATIVE) head.at += count;
+    return APR_SUCCESS;
 }
 
 } // namespace
@@ -115,14 +144,17 @@ int parkSilent(conn_rec* c) noexcept {
     if (std::strcmp(ap_get_protocol(c), AP_PROTOCOL_HTTP1) != 0) return DECLINED;
     static const bool able = canPark();
     if (!able) return DECLINED;
-    auto* seen = static_cast<Seen*>(ap_get_module_config(c->conn_config, &davacl_module));
-    if (!seen) {
-        seen = new (apr_palloc(c->pool, sizeof(Seen))) Seen;
-        ap_set_module_config(c->conn_config, &davacl_module, seen);
+    if (!ap_ssl_conn_is_ssl(c)) return lookAtPlain(c);
+    auto* head = static_cast<Head*>(ap_get_module_config(c->conn_config, &davacl_module));
+    if (!head) {
+        head = new (apr_palloc(c->pool, sizeof(Head))) Head;
+        ap_set_module_config(c->conn_config, &davacl_module, head);
     }
-    const int answer = ap_ssl_conn_is_ssl(c) ? lookAtTLS(c, *seen) : lookAtPlain(c);
-    if (answer == DECLINED) seen->bytes = 0;
-    return answer;
+    return lookAtTLS(c, *head);
+}
+
+void registerParking() {
+    ap_register_input_filter(kGiveBack, giveBack, nullptr, AP_FTYPE_CONNECTION); // above mod_ssl's
 }
 
 } // namespace rolvane::davacl

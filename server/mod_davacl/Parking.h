@@ -9,5 +9,6 @@ namespace rolvane::davacl {
 // of a request is here; until then the MPM watches it, for as long as Timeout says. Under an MPM that cannot wait for
 // input nothing changes.
 int parkSilent(conn_rec* c) noexcept;
+void registerParking();
 
 } // namespace rolvane::davacl

@@ -2,6 +2,7 @@
 
 #include <arpa/inet.h>
 #include <chrono>
+#include <cstdlib>
 #include <gtest/gtest.h>
 #include <memory>
 #include <netinet/in.h>
@@ -21,11 +22,11 @@ namespace {
 constexpr int kStrangers = 500;
 
 // How far each of the stranger's connections goes before it says nothing more.
-enum class Silence { fromTheStart, afterOneByte, afterTheHandshake, withinARequest, afterARefusal };
+enum class Silence { fromTheStart, afterOneByte, afterTheHandshake, withinARequest, afterTwoPieces, afterARefusal };
 
 std::ostream& operator<<(std::ostream& out, Silence silence) {
-    constexpr const char* kNames[] = {"FromTheStart", "AfterOneByte", "AfterTheHandshake", "WithinARequest",
-                                      "AfterARefusal"};
+    constexpr const char* kNames[] = {"FromTheStart",   "AfterOneByte",   "AfterTheHandshake",
+                                      "WithinARequest", "AfterTwoPieces", "AfterARefusal"};
     return out << kNames[static_cast<int>(silence)];
 }
 
@@ -70,6 +71,10 @@ public:
         if (SSL_connect(session) != 1) return;
         char answer[4096];
         if (silence == Silence::withinARequest) SSL_write(session, "GET /dav/ HTTP/1.1\r\nHo", 22);
+        if (silence == Silence::afterTwoPieces) { // of a head, each a TLS record
+            SSL_write(session, "GET /dav/ HTTP/1.1\r\n", 20);
+            SSL_write(session, "Ho", 2);
+        }
         if (silence != Silence::afterARefusal) return;
         const std::string request = "GET /dav/ HTTP/1.1\r\nHost: localhost\r\n\r\n";
         SSL_write(session, request.data(), static_cast<int>(request.size()));
@@ -81,6 +86,51 @@ private:
     int _port;
     std::vector<int> _sockets;
     std::vector<SSL*> _sessions;
+};
+
+class TLSConnection {
+public:
+    explicit TLSConnection(int port) : _context(SSL_CTX_new(TLS_client_method())), _session(SSL_new(_context)) {
+        sockaddr_in address{};
+        address.sin_family = AF_INET;
+        address.sin_port = htons(static_cast<uint16_t>(port));
+        address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+        const timeval patience{20, 0};
+        setsockopt(_socket, SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
+        SSL_set_fd(_session, _socket);
+        if (connect(_socket, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0 || SSL_connect(_session) != 1)
+            throw std::runtime_error("no connection to the store");
+    }
+    ~TLSConnection() {
+        SSL_free(_session);
+        SSL_CTX_free(_context);
+        close(_socket);
+    }
+    TLSConnection(const TLSConnection&) = delete;
+
+    void write(const std::string& piece) {
+        if (SSL_write(_session, piece.data(), static_cast<int>(piece.size())) <= 0)
+            throw std::runtime_error("the store takes no more");
+    }
+    // The statuses of so many answers, fewer when they do not come.
+    std::vector<int> answers(size_t count) {
+        const std::string begin = "HTTP/1.1 ";
+        std::vector<int> all;
+        std::string text;
+        char bytes[4096];
+        for (int n; all.size() < count && (n = SSL_read(_session, bytes, sizeof bytes)) > 0;) {
+            text.append(bytes, static_cast<size_t>(n));
+            all.clear();
+            for (size_t at = 0; (at = text.find(begin, at)) != std::string::npos; at += begin.size())
+                all.push_back(std::atoi(text.c_str() + at + begin.size()));
+        }
+        return all;
+    }
+
+private:
+    SSL_CTX* _context;
+    SSL* _session;
+    int _socket = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
 };
 
 class SilentStrangers : public testing::TestWithParam<Silence> {};
@@ -103,9 +153,47 @@ TEST_P(SilentStrangers, KeepNobodyWaiting) {
     }
 }
 
+// Clients may write a head, and what follows, in as many pieces as they like.
+TEST(PiecesOfARequest, AreAnsweredHoweverManyTLSRecordsTheyAre) {
+    const StoreDirectory directory;
+    PrivateStore store(optionsIn(directory));
+    store.addUser("alice", "word");
+    store.start();
+    const std::string head = "PUT /dav/alice/x HTTP/1.1\r\nHost: localhost\r\nAuthorization: Basic YWxpY2U6d29yZA==\r\n"
+                             "Content-Length: 10\r\n\r\n";
+    const std::string two = head + "0123456789" + head + "abcdefghij"; // the second one goes out with the first
+    for (const size_t length : {size_t{1}, size_t{7}, head.size() - 1, head.size() + 3, two.size()}) {
+        TLSConnection connection(store.status().port);
+        for (size_t at = 0; at < two.size(); at += length) connection.write(two.substr(at, length));
+        EXPECT_EQ(connection.answers(2), (std::vector<int>{length == 1 ? 201 : 204, 204})) << "pieces of " << length;
+    }
+    const CurlClient alice(store, "alice", "word");
+    EXPECT_EQ(alice.request("GET", "/alice/x").body, "abcdefghij");
+}
+
+// More than the whole server can hold at a time.
+TEST_P(SilentStrangers, OfOneAddressGiveWayToOthersWhenTheyAreTooMany) {
+    const StoreDirectory directory;
+    PrivateStoreOptions options = optionsIn(directory);
+    options.threadsPerProcess = 4;
+    options.maximumProcesses = 1;
+    PrivateStore store(options);
+    store.addUser("alice", "word");
+    store.start();
+    const CurlClient alice(store, "alice", "word");
+    ASSERT_EQ(alice.request("PUT", "/alice/x", {}, "x").status, 201);
+    Stranger stranger(store.status().port);
+    for (int i = 0; i < kStrangers; ++i) stranger.hold(GetParam());
+    const auto began = std::chrono::steady_clock::now();
+    EXPECT_EQ(alice.request("GET", "/alice/x").status, 200);
+    const std::chrono::duration<double> waited = std::chrono::steady_clock::now() - began;
+    EXPECT_LT(waited.count(), 15) << "seconds";
+    std::printf("waited %.3f s\n", waited.count());
+}
+
 INSTANTIATE_TEST_SUITE_P(Each, SilentStrangers,
                          testing::Values(Silence::fromTheStart, Silence::afterOneByte, Silence::afterTheHandshake,
-                                         Silence::withinARequest, Silence::afterARefusal),
+                                         Silence::withinARequest, Silence::afterTwoPieces, Silence::afterARefusal),
                          testing::PrintToStringParamName());
 
 } // namespace

@@ -1,0 +1,208 @@
+#include "server/mod_davacl/Newcomers.h"
+
+#include "server/mod_davacl/Configuration.h"
+
+#include <apr_portable.h>
+#include <chrono>
+#include <condition_variable>
+#include <csignal>
+#include <fcntl.h>
+#include <list>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <netinet/in.h>
+#include <string>
+#include <sys/socket.h>
+#include <thread>
+#include <unistd.h>
+#include <unordered_map>
+
+namespace rolvane::davacl {
+namespace {
+
+using Clock = std::chrono::steady_clock;
+constexpr auto kPace = std::chrono::seconds(1);
+constexpr auto kSilent = std::chrono::seconds(1); // a client that is busy may be as slow as this
+
+std::string addressOf(const conn_rec* c) {
+    const apr_sockaddr_t* address = c->client_addr;
+    const char* bytes = static_cast<const char*>(address->ipaddr_ptr);
+    if (address->ipaddr_len == sizeof(in6_addr)) {
+        constexpr size_t kNetwork = 8, kMapped = 12;
+        if (IN6_IS_ADDR_V4MAPPED(reinterpret_cast<const in6_addr*>(bytes)))
+            return {bytes + kMapped, sizeof(in6_addr) - kMapped};
+        return {bytes, kNetwork};
+    }
+    return {bytes, static_cast<size_t>(address->ipaddr_len)};
+}
+
+// The newcomers of one process of httpd.
+class Newcomers {
+public:
+    // The descriptor is a copy, so that its number stays the connection's until it is taken out here.
+    void add(const conn_rec* c, int socket, size_t most) {
+        const std::lock_guard lock(_mutex);
+        const auto [found, isNew] = _all.try_emplace(c);
+        if (!isNew) {
+            found->second.heard = Clock::now();
+            return;
+        }
+        const int copy = fcntl(socket, F_DUPFD_CLOEXEC, 0);
+        if (copy >= 0) found->second = {addressOf(c), copy, most, false, Clock::now()};
+    }
+    void setBusy(const conn_rec* c, bool busy) {
+        const std::lock_guard lock(_mutex);
+        const auto found = _all.find(c);
+        if (found == _all.end()) return;
+        found->second.busy = busy;
+        found->second.heard = Clock::now();
+    }
+    bool knows(const conn_rec* c) {
+        const std::lock_guard lock(_mutex);
+        return _all.contains(c);
+    }
+    // It counts no more; the entry stays as long as the connection, so that it does not come in again.
+    void forget(const conn_rec* c) {
+        const std::lock_guard lock(_mutex);
+        if (const auto found = _all.find(c); found != _all.end()) release(found->second);
+    }
+    void remove(const conn_rec* c) {
+        const std::lock_guard lock(_mutex);
+        const auto found = _all.find(c);
+        if (found == _all.end()) return;
+        release(found->second);
+        _all.erase(found);
+    }
+    void closeSurplus() {
+        const std::lock_guard lock(_mutex);
+        std::map<std::string, std::multimap<Clock::time_point, One*>> silent;
+        std::map<std::string, size_t> held;
+        const auto now = Clock::now();
+        for (auto& [c, one] : _all) {
+            if (one.socket < 0) continue;
+            ++held[one.address];
+            if (!one.busy && now - one.heard >= kSilent) silent[one.address].emplace(one.heard, &one);
+        }
+        for (auto& [address, all] : silent)
+            for (auto& [heard, one] : all) {
+                if (held[address] <= one->most) break;
+                char byte = 0;
+                if (recv(one->socket, &byte, 1, MSG_PEEK | MSG_DONTWAIT) > 0) continue; // it waits for us
+                shutdown(one->socket, SHUT_RDWR);                                       // httpd finds its end
+                release(*one);
+                --held[address];
+            }
+    }
+
+private:
+    struct One {
+        std::string address;
+        int socket = -1; // none: it does not count
+        size_t most = 0;
+        bool busy = false;
+        Clock::time_point heard = {};
+    };
+    static void release(One& one) {
+        if (one.socket >= 0) close(one.socket);
+        one.socket = -1;
+    }
+
+    std::mutex _mutex;
+    std::unordered_map<const conn_rec*, One> _all; // guarded by _mutex
+};
+
+// Lives as long as the process: other threads may still ask when it ends.
+Newcomers& newcomers() {
+    static auto* all = new Newcomers;
+    return *all;
+}
+
+apr_status_t connectionEnds(void* c) {
+    newcomers().remove(static_cast<conn_rec*>(c));
+    return APR_SUCCESS;
+}
+
+const conn_rec* connectionOf(const request_rec* r) {
+    return r->connection->master ? r->connection->master : r->connection;
+}
+
+class Watch {
+public:
+    Watch() {
+        sigset_t all, before;
+        sigfillset(&all);
+        pthread_sigmask(SIG_SETMASK, &all, &before); // signals are the other threads'
+        _thread = std::thread([this] { serve(); });
+        pthread_sigmask(SIG_SETMASK, &before, nullptr);
+    }
+    ~Watch() {
+        {
+            const std::lock_guard lock(_mutex);
+            _ended = true;
+        }
+        _end.notify_all();
+        _thread.join();
+    }
+    Watch(const Watch&) = delete;
+    Watch& operator=(const Watch&) = delete;
+
+private:
+    void serve() {
+        std::unique_lock lock(_mutex);
+        while (!_end.wait_for(lock, kPace, [this] { return _ended; })) newcomers().closeSurplus();
+    }
+    std::mutex _mutex;
+    std::condition_variable _end;
+    bool _ended = false; // guarded by _mutex
+    std::thread _thread;
+};
+
+apr_status_t endWatch(void* watch) {
+    delete static_cast<Watch*>(watch);
+    return APR_SUCCESS;
+}
+
+} // namespace
+
+int noteConnection(conn_rec* c) noexcept {
+    const int most = c->master ? 0 : mostNewcomers(c->base_server);
+    apr_os_sock_t socket = -1;
+    if (most <= 0 || !c->client_addr || !ap_get_conn_socket(c) ||
+        apr_os_sock_get(&socket, ap_get_conn_socket(c)) != APR_SUCCESS)
+        return DECLINED;
+    try {
+        if (!newcomers().knows(c)) apr_pool_cleanup_register(c->pool, c, connectionEnds, apr_pool_cleanup_null);
+        newcomers().add(c, socket, static_cast<size_t>(most));
+    } catch (const std::exception&) { // without memory for it, it is not counted
+    }
+    return DECLINED;
+}
+
+int noteRequest(request_rec* r) noexcept {
+    newcomers().setBusy(connectionOf(r), true);
+    return DECLINED;
+}
+
+int noteSignIn(request_rec* r) noexcept {
+    if (r->user && !r->main) newcomers().forget(connectionOf(r));
+    return DECLINED;
+}
+
+int noteAnswer(request_rec* r) noexcept {
+    newcomers().setBusy(connectionOf(r), false);
+    return DECLINED;
+}
+
+void watchNewcomers(apr_pool_t* pool, server_rec* server) noexcept {
+    bool wanted = false;
+    for (const server_rec* each = server; each; each = each->next) wanted = wanted || mostNewcomers(each) > 0;
+    if (!wanted) return;
+    try {
+        apr_pool_cleanup_register(pool, new Watch, endWatch, apr_pool_cleanup_null);
+    } catch (const std::exception& e) {
+        ap_log_error(APLOG_MARK, APLOG_ERR, 0, server, "davacl: newcomers are not watched: %s", e.what());
+    }
+}
+
+} // namespace rolvane::davacl
