@@ -193,6 +193,33 @@ TEST_F(BooksCommand, AQRCodeHoldsAddressNameAndPassword) {
         << read;
 }
 
+// vdirsyncer asks for it where both sides of a link have changed a card.
+TEST_F(BooksCommand, OneCardOfTwoHasWhatEitherHas) {
+    const auto card = [](const std::string& lines) {
+        return "BEGIN:VCARD\r\nVERSION:3.0\r\nUID:one\r\nFN:Ada\r\nN:;Ada;;;\r\n" + lines + "END:VCARD\r\n";
+    };
+    const std::string first =
+        world.write("a.vcf", card("EMAIL;TYPE=HOME:ada@example.org\r\nEMAIL;TYPE=WORK:a@work.example\r\nTITLE:Cook\r\n"
+                                  "NOTE:first\r\nX-OURS:1\r\n"));
+    const std::string second = world.write(
+        "b.vcf", card("EMAIL;TYPE=HOME:ada@example.org\r\nTEL;TYPE=HOME:+1 555 0100\r\nTITLE:Chef\r\nX-THEIRS:2\r\n"));
+    done({"books", "merge-cards", first, second});
+    const auto textOf = [](const std::string& path) {
+        std::ifstream file(path, std::ios::binary);
+        return std::string(std::istreambuf_iterator<char>(file), {});
+    };
+    const std::string merged = textOf(first);
+    EXPECT_EQ(textOf(second), merged);
+    for (const char* part : {"UID:one", "ada@example.org", "a@work.example", "+1 555 0100", "TITLE:Cook", "first",
+                             "Chef", "X-OURS:1", "X-THEIRS:2"})
+        EXPECT_THAT(merged, HasSubstr(part));
+    EXPECT_EQ(merged.find("ada@example.org"), merged.rfind("ada@example.org")) << "what both have is there once";
+    EXPECT_EQ(merged.find("UID"), merged.rfind("UID")) << merged;
+    const std::string none = world.write("c.vcf", "no card");
+    EXPECT_EQ(world.rolvane({"books", "merge-cards", first, none}).status, 1);
+    EXPECT_EQ(textOf(first), merged) << "nothing is changed";
+}
+
 TEST_F(BooksCommand, SayWhatToDoWhenTheyCannotBeSwitchedOn) {
     const Ran device = world.rolvane({"books", "device", "add", "phone"});
     EXPECT_EQ(device.status, 1) << device;
