@@ -290,6 +290,40 @@ TEST(StoreTrials, FindWhatAServerDoesAndLeaveNothing) {
     EXPECT_TRUE(some.tags && some.conditions && some.accessLists);
 }
 
+// A server may say that it has made what was there: taking that away again would take everybody's trees.
+TEST(StoreTrials, TakeNothingAwayThatWasThereBefore) {
+    Oddities odd;
+    odd.makesAgain = true;
+    OddServer server(odd);
+    OddClient alice(server), bob(server, "bob");
+    CXDAVError error;
+    ASSERT_TRUE(alice.manager->canReach(error)) << error.reason;
+    ASSERT_TRUE(alice.manager->sanityCheckPublishStructureCreate(true));
+    EXPECT_EQ(alice.write("dateFile", Dictionary{{"a", 1}}), 204);
+    const auto files = server.files();
+    const auto collections = server.collections();
+    for (OddClient* client : {&bob, &alice}) {
+        ASSERT_TRUE(client->manager->canReach(error)) << error.reason;
+        EXPECT_FALSE(tryStore(*client->manager).hindrance);
+        EXPECT_EQ(server.files(), files) << client->wire->text();
+        EXPECT_EQ(server.collections(), collections) << client->wire->text();
+    }
+}
+
+// Two people try a store at the same time: what the one has put into a folder of the other's trial stays.
+TEST(StoreTrials, TakeNoFolderAwayThatHoldsSomethingByThen) {
+    OddServer server;
+    OddClient bob(server, "bob");
+    CXDAVError error;
+    ASSERT_TRUE(bob.manager->canReach(error)) << error.reason;
+    bob.wire->intercept([&](const HttpRequest& r) {
+        if (r.method == "LOCK") server.write("/dav/bob/of another", "kept");
+        return std::optional<HttpResponse>();
+    });
+    EXPECT_FALSE(tryStore(*bob.manager).hindrance);
+    EXPECT_EQ(server.files(), (std::map<std::string, std::string>{{"/dav/bob/of another", "kept"}}));
+}
+
 TEST(StoreTrials, SayWhatCannotWork) {
     for (const int status : {403, 405, 501, 507}) {
         Oddities odd;

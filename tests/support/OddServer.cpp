@@ -136,7 +136,7 @@ FakeAnswer OddServer::answerTo(const FakeRequest& request, const std::string& pa
     if (method == "PROPFIND") return exists(path) ? listing(request, path) : said(404);
     if (method == "MKCOL") {
         if (_odd.mkcol != 0) return said(_odd.mkcol);
-        if (exists(path)) return said(405);
+        if (exists(path)) return said(_odd.makesAgain ? 201 : 405);
         if (!_collections.contains(parentOf(path)) || (_odd.wantsSlash && !slash)) return said(409);
         _collections.insert(path);
         return said(201);

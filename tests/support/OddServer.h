@@ -22,16 +22,17 @@ struct Oddities {
     bool namesItself = true;             // a listing begins with the collection itself
     bool statuses = true;                // a propstat has its status
     int multistatus = 207;
-    std::string doctype;    // before a multistatus
-    std::string hrefOrigin; // before the path in every href, as behind a proxy
-    std::string encoding;   // of every body: "gzip" is made, others are only said
-    int ifWithTag = 0;      // the answer to every If that holds an entity tag, whatever lies there
-    int ifNoneMatch = 0;    // the same to every If-None-Match
-    int lockGranted = 200;  // 5xx: the lock stands all the same
-    bool tellsLocks = true; // lockdiscovery
-    int deleted = 204;      // 207: a multistatus in which all is well
-    int mkcol = 0;          // the answer to every MKCOL
-    int put = 0;            // the answer to every PUT
+    std::string doctype;     // before a multistatus
+    std::string hrefOrigin;  // before the path in every href, as behind a proxy
+    std::string encoding;    // of every body: "gzip" is made, others are only said
+    int ifWithTag = 0;       // the answer to every If that holds an entity tag, whatever lies there
+    int ifNoneMatch = 0;     // the same to every If-None-Match
+    int lockGranted = 200;   // 5xx: the lock stands all the same
+    bool tellsLocks = true;  // lockdiscovery
+    int deleted = 204;       // 207: a multistatus in which all is well
+    int mkcol = 0;           // the answer to every MKCOL
+    int put = 0;             // the answer to every PUT
+    bool makesAgain = false; // MKCOL of a collection that is there is 201
 };
 
 // A small WebDAV server in memory, over real sockets, with habits. Depth 0 and 1, exclusive locks of one resource.

@@ -36,7 +36,8 @@ class Trial {
 public:
     explicit Trial(CXDAVManager::Impl& client) : _session(client.session) {}
     ~Trial() {
-        for (auto made = _made.rbegin(); made != _made.rend(); ++made) (void)ask("DELETE", *made);
+        for (auto made = _made.rbegin(); made != _made.rend(); ++made)
+            if (*made == _folder || holdsNothing(*made)) (void)ask("DELETE", *made);
     }
     Trial(const Trial&) = delete;
     Trial& operator=(const Trial&) = delete;
@@ -87,22 +88,41 @@ private:
         return false;
     }
 
+    // Whoever has put something there meanwhile keeps it: DELETE takes all that lies below.
+    bool holdsNothing(const Url& folder) {
+        const HttpResponse listed = _session.send(StoreSession::propfind(folder, 1), isAny);
+        MultistatusReader reader;
+        const auto entries = listed.status == 207 && reader.feed(listed.body) ? reader.finish() : std::nullopt;
+        if (!entries || entries->size() > 1) return false;
+        if (entries->empty()) return true;
+        std::string href = Url::percentDecode(entries->front().href);
+        if (href.ends_with('/')) href.pop_back();
+        return entries->front().isCollection && href.ends_with("/" + folder.cxLastComponent());
+    }
+
+    // Some servers answer MKCOL of a folder that is there as if they had made it (rclone: 201). What was there before
+    // is not the trial's, and stays.
+    HttpResponse make(const Url& folder) {
+        const bool wasMissing = _session.send(StoreSession::propfind(folder, 0), isAny).status == 404;
+        HttpResponse made = ask("MKCOL", folder);
+        if (made.ok() && wasMissing) _made.push_back(folder);
+        return made;
+    }
+
     bool makesFolders() {
         const CXDAVAccount& account = _session.account();
         const Url name = account.baseLocationFor(account.user);
         const Url tree = _tree = *_session.collectionEndpoint(name, true);
-        HttpResponse made = ask("MKCOL", tree);
+        HttpResponse made = make(tree);
         if (made.status == 409 || made.status == 404) { // the folders above it are missing
             std::vector<Url> above;
             for (Url u = tree.cxURLByDeletingLastComponent(); !u.cxLastComponent().empty();
                  u = u.cxURLByDeletingLastComponent())
                 above.insert(above.begin(), namedAsCollection(u));
-            for (const Url& u : above)
-                if (ask("MKCOL", u).ok()) _made.push_back(u);
-            made = ask("MKCOL", tree);
+            for (const Url& u : above) (void)make(u);
+            made = make(tree);
         }
-        if (made.ok()) _made.push_back(tree);
-        const Url folder = namedAsCollection(tree.cxURLByAppendingComponent("trial-" + makeUUID()));
+        const Url folder = _folder = namedAsCollection(tree.cxURLByAppendingComponent("trial-" + makeUUID()));
         made = ask("MKCOL", folder);
         if (!made.ok()) return refused("The store makes no folders", "MKCOL", made);
         _made.push_back(folder);
@@ -194,7 +214,7 @@ private:
     StoreSession& _session;
     StoreTrial _found;
     std::vector<Url> _made; // from the outside in
-    Url _tree, _file;
+    Url _tree, _folder, _file;
 };
 
 } // namespace
