@@ -3,6 +3,7 @@
 #include "Examples.h"
 #include "SafeText.h"
 
+#include "contacts/database/DaemonMemory.h"
 #include "contacts/database/DamagedDatabase.h"
 #include "daemon/InstanceLock.h"
 #include "foundation/Preferences.h"
@@ -21,7 +22,9 @@ struct Context::Impl {
     bool opened = false;
 };
 
-Context::Context() : _impl(std::make_unique<Impl>()) {}
+Context::Context() : _impl(std::make_unique<Impl>()) {
+    Preferences::shared().keepElsewhere(daemonMemory());
+}
 
 Context::~Context() {
     if (_impl->opened) CXRolvane::closeShared();

@@ -105,6 +105,10 @@ public:
         return applyChangeRecordIfNeeded(record, nullptr);
     }
 
+    // The pass has been stored, or could not be: what the source has given in it is in the contact database, or not.
+    virtual void passWasStored() {}
+    virtual void passWasNotStored() {}
+
     std::string stringForDictionary(const Dictionary& dictionary) const; // XML property list
     virtual bool saveACLs();                                             // true always
     virtual std::shared_ptr<CXACLManager> ACLManagerForRemoteLocation(const Url& location);

@@ -21,8 +21,9 @@ public:
     virtual Dictionary conduitObjectForKey(const std::string& conduitID, const std::string& key) = 0;
     virtual void setConduitObjectForKey(const std::string& conduitID, const Value& object, const std::string& key) = 0;
     virtual void syncPrefs() = 0;
-    // Before a pass's changes are saved to the contact database while more of them are to come. Main thread.
-    virtual void willSaveInThePass() {}
+    // Saves the contact database while more changes of the pass are to come, together with what the engine remembers of
+    // those before: when the change that is being applied is done. Main thread.
+    virtual void saveInThePass() = 0;
 
     virtual bool isRevoked(const RemoteLocation& location) const = 0;
     virtual std::vector<RemoteLocation> revokedRemoteLocations() const = 0;

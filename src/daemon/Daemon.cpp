@@ -5,6 +5,7 @@
 #include "conduits/store/CXDVaultraConduit.h"
 #include "contacts/database/CXRolvane.h"
 #include "contacts/database/CXUserDefaults.h"
+#include "contacts/database/DaemonMemory.h"
 #include "contacts/database/DamagedDatabase.h"
 #include "contacts/records/CXAllGroup.h"
 #include "daemon/BootTimer.h"
@@ -99,8 +100,9 @@ public:
         options.distributed = &_channel;
         options.runLoop = &_loop;
         requireKnownDatabase(options.path, Preferences::shared());
+        Preferences::shared().keepElsewhere(daemonMemory());
         CXRolvane::configureShared(options);
-        CXRolvane::sharedRolvane().recoverShareCount(Preferences::shared());
+        CXRolvane::sharedRolvane();
         CXDSyncEngine::setMaker([this] { return makeEngine(); });
     }
 

@@ -48,7 +48,6 @@ void append(CXDChangeRecords& to, CXDChangeRecords&& from) {
 CXDSyncEngine::CXDSyncEngine(const EngineCollaborators& collaborators)
     : _parts(std::make_unique<EngineParts>(collaborators)) {
     _parts->with.account.setFailedPasswordHandler([this] { failedToGetPassword(); });
-    recoverConduitData(*_parts);
     _parts->conduits = _parts->with.makeConduits(*this);
     updateStateAndExitIfNeeded();
     _parts->with.account.updateConfigDataIfNeeded();
@@ -201,6 +200,7 @@ void CXDSyncEngine::makePass(bool allowRetry, bool isRetry) {
         checkCXShareCount();
         _parts->state.dropConduitData();
         _parts->state.conduitData();
+        _parts->marksOfThePass = _parts->state.marks();
         // What was revoked before is forgotten already; what is subscribed to again is not revoked.
         _parts->revoked.clear();
         forgetFormerSubscriptions(*_parts);
@@ -301,8 +301,8 @@ Dictionary CXDSyncEngine::knownGroupState(const std::string& conduitID, const Us
     });
     return known;
 }
-void CXDSyncEngine::willSaveInThePass() {
-    if (_parts->beforeSaveInThePass) _parts->beforeSaveInThePass();
+void CXDSyncEngine::saveInThePass() {
+    _parts->saveInThePass = true;
 }
 void CXDSyncEngine::syncPrefs() {
     _parts->state.syncPrefs();

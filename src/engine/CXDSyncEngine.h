@@ -62,7 +62,7 @@ public:
     void setConduitObjectForKey(const std::string& conduitID, const Value& object, const std::string& key) override;
     Dictionary knownGroupState(const std::string& conduitID, const UserName& user, const UniqueId& group) override;
     void syncPrefs() override;
-    void willSaveInThePass() override;
+    void saveInThePass() override;
     CXDChangeRecords getPendingChanges() const;
     bool hasPendingChanges(const UserName& user, int32_t source) override;
     void setPendingChanges(const CXDChangeRecords& records);

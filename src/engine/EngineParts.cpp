@@ -2,7 +2,6 @@
 
 #include "contacts/database/CXRolvane.h"
 #include "engine/queue/RefusedChanges.h"
-#include "engine/recovery/Arrivals.h"
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
 #include "model/PayloadKeys.h"
@@ -92,37 +91,16 @@ void killCXD(EngineParts& parts) {
 
 void checkCXShareCount(EngineParts& parts) {
     Preferences& preferences = parts.with.preferences;
-    const auto sameDatabase = [&] {
-        return preferences.get(kDaemonDomain, kCXDShareCount).integer() == parts.with.rolvane.shareCount();
-    };
-    if (!preferences.get(kDaemonDomain, kCXDShareCount)) {
+    const Value count = preferences.get(kDaemonDomain, kCXDShareCount);
+    if (!count) {
         CXDLog("First Sync");
-    } else if (!sameDatabase()) {
-        // A crash or a failed save may have stopped between the two counts.
-        parts.with.rolvane.recoverShareCount(preferences);
-        if (!sameDatabase()) {
-            parts.state.reset();
-            return;
-        }
+    } else if (count.integer() != parts.with.rolvane.shareCount()) {
+        parts.state.reset();
+        return;
     }
     const std::optional<std::string> last = preferences.get(kDaemonDomain, kCXDLastOstrelUser).optionalString();
     const std::optional<UserName> user = parts.with.account.vaultraUser();
     if (!user || !last || user->str() != *last) parts.state.reset();
-}
-
-void recoverConduitData(EngineParts& parts) {
-    CXRolvane& rolvane = parts.with.rolvane;
-    const std::optional<UserName> own = parts.with.account.vaultraUser();
-    const auto locationOf = [&](const UserName& user) -> std::optional<RemoteLocation> {
-        if (user == kSelf) return RemoteLocation();
-        for (const CXSubscriptionRef& subscription : rolvane.subscriptions())
-            if (userForRemoteLocation(subscription->remoteLocation(), own, parts.with.loginName) == user)
-                return subscription->remoteLocation();
-        return std::nullopt;
-    };
-    parts.state.recoverConduitData(
-        [&](const Dictionary& mark) { return rolvane.hasSavedSince(mark); },
-        [&](Dictionary& data, const Array& arrivals) { foldArrivals(data, arrivals, rolvane, locationOf); });
 }
 
 void updateStateAndExitIfNeeded(EngineParts& parts) {

@@ -31,7 +31,8 @@ struct EngineParts {
     mutable bool ending = false;               // killCXD has begun; main thread
     bool retryScheduled = false;               // a retry pass waits on the run loop; main thread
     int passesAskedFor = 0;                    // those that wait for the end of the one that runs; main thread
-    std::function<void()> beforeSaveInThePass; // while changes are applied in order; main thread
+    bool saveInThePass = false;                // a conduit asks for it; main thread
+    Dictionary marksOfThePass;                 // as they were before the scan took them; main thread
     const std::thread::id mainThread = std::this_thread::get_id();
 
     bool vaultraOffLine() const { return conduits.vaultraOffLine && conduits.vaultraOffLine(); }
@@ -46,8 +47,6 @@ void endPass(EngineParts& parts);
 
 // checkCXShareCount: forgets everything when the database is not the one of the last pass, or the account is another.
 void checkCXShareCount(EngineParts& parts);
-// Carries out what a pass meant to remember that has saved the database and come to no end.
-void recoverConduitData(EngineParts& parts);
 // updateStateAndExitIfNeeded: without an account no remote subscription and no publication are left; with nothing
 // published and fewer than two subscriptions the process ends.
 void updateStateAndExitIfNeeded(EngineParts& parts);

@@ -1,6 +1,7 @@
 #include "foundation/Preferences.h"
 
 #include "foundation/CXException.h"
+#include "foundation/Log.h"
 #include "foundation/Paths.h"
 #include "foundation/PreferencesFile.h"
 #include "foundation/PropertyList.h"
@@ -42,9 +43,70 @@ struct Preferences::Impl {
         }
     }
 
+    bool isKept(std::string_view domain, std::string_view key) const { return keeper && keeper->keeps(domain, key); }
+
+    // Moves what an earlier version left in the file. The removal comes last, so a crash repeats the whole.
+    void move() {
+        if (!keeper || moved) return;
+        PreferencesFile::Changes values, removals;
+        for (const std::string& key : file.keys(keeper->domain()))
+            if (keeper->keeps(keeper->domain(), key)) {
+                values.emplace(key, file.read(keeper->domain(), key));
+                removals.emplace(key, std::nullopt);
+            }
+        if (!values.empty()) {
+            keeper->write(values);
+            file.write(keeper->domain(), removals);
+        }
+        moved = true;
+    }
+
+    bool hasMoved() {
+        try {
+            move();
+        } catch (const CXException& e) {
+            CXDLog("What the preferences file has of the contact database stays there: %@", e);
+            return false;
+        }
+        return true;
+    }
+
+    std::optional<Bytes> read(std::string_view domain, std::string_view key) {
+        if (!isKept(domain, key)) return file.read(domain, key);
+        if (!hasMoved())
+            if (auto bytes = file.read(domain, key)) return bytes;
+        return keeper->read(key);
+    }
+
+    void write(std::string_view domain, PreferencesFile::Changes& changes) {
+        PreferencesFile::Changes kept;
+        for (auto change = changes.begin(); change != changes.end();)
+            if (isKept(domain, change->first))
+                kept.insert(changes.extract(change++));
+            else
+                ++change;
+        try {
+            if (!kept.empty() && !held) {
+                move();
+                keeper->write(kept);
+                kept.clear();
+            }
+            if (!changes.empty()) {
+                file.write(domain, changes);
+                changes.clear();
+            }
+        } catch (...) {
+            changes.merge(kept);
+            throw;
+        }
+        changes.merge(kept);
+    }
+
     std::set<std::string> keysWithChanges(std::string_view domain) {
         auto stored = file.keys(domain);
         std::set<std::string> all(stored.begin(), stored.end());
+        if (keeper && keeper->domain() == domain && hasMoved())
+            for (std::string& key : keeper->keys()) all.insert(std::move(key));
         if (auto changes = staged.find(domain); changes != staged.end())
             for (const auto& [key, bytes] : changes->second) {
                 if (bytes)
@@ -57,6 +119,9 @@ struct Preferences::Impl {
 
     std::mutex mutex; // of everything below
     PreferencesFile file;
+    std::shared_ptr<PreferencesKeeper> keeper;
+    bool moved = false; // the file has nothing of the keeper's any more
+    bool held = false;
     std::map<std::string, PreferencesFile::Changes, std::less<>> staged;
 };
 
@@ -72,7 +137,7 @@ Value Preferences::get(std::string_view domain, std::string_view key) const {
         if (auto* change = _impl->unwritten(domain, key))
             bytes = *change;
         else
-            bytes = _impl->file.read(domain, key);
+            bytes = _impl->read(domain, key);
     }
     return bytes ? _impl->decode(domain, key, std::move(*bytes)) : Value();
 }
@@ -94,8 +159,48 @@ void Preferences::synchronize(std::string_view domain) {
     std::lock_guard guard(_impl->mutex);
     auto changes = _impl->staged.find(domain);
     if (changes == _impl->staged.end()) return;
-    _impl->file.write(domain, changes->second);
-    _impl->staged.erase(changes);
+    _impl->write(domain, changes->second);
+    if (changes->second.empty()) _impl->staged.erase(changes);
+}
+
+void Preferences::keepElsewhere(std::shared_ptr<PreferencesKeeper> keeper) {
+    std::lock_guard guard(_impl->mutex);
+    _impl->keeper = std::move(keeper);
+    _impl->moved = false;
+}
+
+Preferences::Hold::Hold(Preferences& preferences) : _preferences(preferences) {
+    std::lock_guard guard(_preferences._impl->mutex);
+    _preferences._impl->held = true;
+}
+
+Preferences::Hold::~Hold() {
+    if (_holds) end();
+}
+
+PreferencesChanges Preferences::Hold::changes() const {
+    Impl& all = *_preferences._impl;
+    std::lock_guard guard(all.mutex);
+    all.move();
+    PreferencesChanges kept;
+    if (!all.keeper) return kept;
+    if (const auto changes = all.staged.find(all.keeper->domain()); changes != all.staged.end())
+        for (const auto& [key, bytes] : changes->second)
+            if (all.keeper->keeps(changes->first, key)) kept.emplace(key, bytes);
+    return kept;
+}
+
+void Preferences::Hold::end() {
+    _holds = false;
+    Impl& all = *_preferences._impl;
+    std::lock_guard guard(all.mutex);
+    all.held = false;
+    if (!all.keeper) return;
+    const auto changes = all.staged.find(all.keeper->domain());
+    if (changes == all.staged.end()) return;
+    std::erase_if(changes->second,
+                  [&](const auto& change) { return all.keeper->keeps(changes->first, change.first); });
+    if (changes->second.empty()) all.staged.erase(changes);
 }
 
 std::vector<std::string> Preferences::keys(std::string_view domain) const {
@@ -108,6 +213,7 @@ std::vector<std::string> Preferences::domains() const {
     std::lock_guard guard(_impl->mutex);
     auto stored = _impl->file.domains();
     std::set<std::string> all(stored.begin(), stored.end());
+    if (_impl->keeper && !_impl->keysWithChanges(_impl->keeper->domain()).empty()) all.insert(_impl->keeper->domain());
     for (const auto& [domain, changes] : _impl->staged) {
         if (_impl->keysWithChanges(domain).empty())
             all.erase(domain);

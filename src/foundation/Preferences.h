@@ -2,12 +2,29 @@
 
 #include "foundation/Value.h"
 
+#include <map>
 #include <memory>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
 
 namespace rolvane {
+
+// Unwritten changes of a domain by key; no bytes: removal.
+using PreferencesChanges = std::map<std::string, std::optional<Bytes>, std::less<>>;
+
+// Keeps some keys of one domain in another file than the preferences', with what they belong to. Called with the
+// lock of the preferences held. Failures throw CXException.
+class PreferencesKeeper {
+public:
+    virtual ~PreferencesKeeper() = default;
+    virtual bool keeps(std::string_view domain, std::string_view key) const = 0; // the same answer always
+    virtual const std::string& domain() const = 0;
+    virtual std::optional<Bytes> read(std::string_view key) = 0;
+    virtual std::vector<std::string> keys() = 0;
+    virtual void write(const PreferencesChanges& changes) = 0; // one transaction, durable on return
+};
 
 // Preferences: a row per domain and key in one SQLite file (synchronous=FULL). Writes and removals are kept in memory,
 // visible to this process's reads at once, until `synchronize` writes them in one transaction; reads of keys that have
@@ -21,6 +38,9 @@ class Preferences {
 public:
     // The file is made on the first write, mode 0600, directories 0700. Nothing is opened before it is needed.
     explicit Preferences(std::string path, double lockTimeoutSeconds = 4);
+    Preferences(std::string path, std::shared_ptr<PreferencesKeeper> keeper) : Preferences(std::move(path)) {
+        keepElsewhere(std::move(keeper));
+    }
     ~Preferences();
     Preferences(const Preferences&) = delete;
     Preferences& operator=(const Preferences&) = delete;
@@ -33,6 +53,27 @@ public:
     std::vector<std::string> keys(std::string_view domain) const; // in byte order, unwritten changes included
     std::vector<std::string> domains() const;                     // those with a key, in byte order
     const std::string& path() const;
+
+    // From now on the keeper has its keys. Values that an earlier version left in the file move to it with the first
+    // use, and are read where they are as long as they cannot move.
+    void keepElsewhere(std::shared_ptr<PreferencesKeeper> keeper);
+
+    // While it lives, synchronize leaves the keeper's keys unwritten: their owner writes them together with something
+    // else. Destroying it drops what is unwritten of them: what is stored counts again. One at a time.
+    class Hold {
+    public:
+        explicit Hold(Preferences& preferences);
+        ~Hold();
+        Hold(const Hold&) = delete;
+        Hold& operator=(const Hold&) = delete;
+
+        PreferencesChanges changes() const; // of the keeper's keys
+        void end();                         // they are written; no hold any more
+
+    private:
+        Preferences& _preferences;
+        bool _holds = true;
+    };
 
     // stateDirectory()/preferences.db, found anew at every call: one object a path, living for the process.
     static Preferences& shared();

@@ -1,8 +1,7 @@
 #pragma once
 
-#include "foundation/Value.h"
+#include "foundation/Preferences.h"
 
-#include <map>
 #include <memory>
 #include <optional>
 #include <string>
@@ -20,7 +19,7 @@ namespace rolvane {
 // kCXPreferencesException and leave the file as it was.
 class PreferencesFile {
 public:
-    using Changes = std::map<std::string, std::optional<Bytes>, std::less<>>; // no bytes: removal
+    using Changes = PreferencesChanges;
 
     PreferencesFile(std::string path, double lockTimeoutSeconds);
     ~PreferencesFile();

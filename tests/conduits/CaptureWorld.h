@@ -4,6 +4,7 @@
 #include "FakeEngine.h"
 #include "conduits/database/CXDCXConduit.h"
 #include "contacts/database/CXRolvane.h"
+#include "contacts/database/DaemonMemory.h"
 #include "contacts/records/Constants.h"
 #include "contacts/records/Identifier.h"
 #include "foundation/Preferences.h"
@@ -35,7 +36,10 @@ inline CXMultiValue principals(std::initializer_list<const char*> names) {
 // until a test moves it; every save moves it by a second, so that dates tell saves apart.
 class CaptureWorld : public testing::Test {
 public:
-    CaptureWorld() { conduit = makeConduit(); }
+    CaptureWorld() {
+        engine.whenSaving = [this] { database.save(); };
+        conduit = makeConduit();
+    }
 
     std::unique_ptr<CXDCXConduit> makeConduit() {
         // Saves of this very process count as another's, because the tests are both sides.
@@ -126,7 +130,7 @@ public:
     TempDirectory directory;
     ManualClock clock{Date(1'800'000'000)};
     NotificationCenter center;
-    Preferences preferences{directory / "preferences.db"};
+    Preferences preferences{directory / "preferences.db", daemonMemory(directory / "contacts.db")};
     CXRolvane database{daemonDatabase(directory, clock, center)};
     FakeEngine engine;
     std::unique_ptr<CXDCXConduit> conduit;

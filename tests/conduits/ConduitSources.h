@@ -9,6 +9,7 @@
 #include "conduits/local/CXDLocalConduit.h"
 #include "conduits/store/CXDVaultraConduit.h"
 #include "contacts/database/CXRolvane.h"
+#include "contacts/database/DaemonMemory.h"
 #include "contacts/records/Constants.h"
 #include "foundation/Paths.h"
 #include "foundation/Preferences.h"
@@ -64,7 +65,7 @@ public:
     TempDirectory directory;
     ManualClock clock{Date(1'800'000'000)};
     NotificationCenter center;
-    Preferences preferences{directory / "preferences.db"};
+    Preferences preferences{directory / "preferences.db", daemonMemory(directory / "contacts.db")};
     CXRolvane database{daemonDatabase(directory, clock, center)};
 };
 

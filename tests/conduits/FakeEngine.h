@@ -33,6 +33,9 @@ public:
         data.dictionaryFor(conduitID).set(key, object);
     }
     void syncPrefs() override { note("syncPrefs"); }
+    void saveInThePass() override {
+        if (whenSaving) whenSaving();
+    }
 
     bool isRevoked(const RemoteLocation& location) const override {
         return std::find(revoked.begin(), revoked.end(), location) != revoked.end();
@@ -82,6 +85,7 @@ public:
     void cancel() override { note("cancel"); }
 
     mutable std::function<void()> whenAskedForAUser; // once
+    std::function<void()> whenSaving; // in the middle of a pass
     std::vector<Refusal> refused;
 
     std::vector<std::string> takeCalls() {

@@ -4,6 +4,7 @@
 #include "FakeEngine.h"
 #include "TestRecord.h"
 #include "contacts/database/CXRolvane.h"
+#include "contacts/database/DaemonMemory.h"
 #include "contacts/records/Constants.h"
 #include "foundation/Paths.h"
 #include "foundation/Preferences.h"
@@ -60,7 +61,7 @@ protected:
     const std::string root = directory / "shared";
     FakeEngine engine;
     ManualClock clock{Date(1'800'000'000)};
-    Preferences preferences{directory / "preferences.db"};
+    Preferences preferences{directory / "preferences.db", daemonMemory(directory / "contacts.db")};
     NotificationCenter center;
     CXRolvane database{daemonDatabase(directory, clock, center)};
     CapturingLog log;
@@ -132,7 +133,7 @@ TEST_F(LocalConduit, ClosingForgetsRevokedUsersAndKeepsTheDateForTheNextRun) {
     conduit->close();
     EXPECT_EQ(engine.priorState("CXDLocal").allKeys(), Texts{"eve"});
     EXPECT_EQ(conduit->lastSyncDate(), clock.now());
-    EXPECT_EQ(Preferences(directory / "preferences.db").get(kDaemonDomain, "CXDLocalConduitLastSyncDate"),
+    EXPECT_EQ(Preferences(directory / "preferences.db", daemonMemory(directory / "contacts.db")).get(kDaemonDomain, "CXDLocalConduitLastSyncDate"),
               Value(clock.now()))
         << "synchronised at once";
     clock.advance(60);

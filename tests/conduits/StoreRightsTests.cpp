@@ -5,6 +5,7 @@
 #include "conduits/UserAlert.h"
 #include "conduits/store/CXDVaultraConduit.h"
 #include "contacts/database/CXRolvane.h"
+#include "contacts/database/DaemonMemory.h"
 #include "contacts/records/Constants.h"
 #include "foundation/Preferences.h"
 #include "store/account/CXNetworkController.h"
@@ -71,7 +72,7 @@ protected:
     ManualClock clock{Date(1'800'000'000)};
     NotificationCenter center;
     LocalNotifications distributed;
-    Preferences preferences{directory / "preferences.db"};
+    Preferences preferences{directory / "preferences.db", daemonMemory(directory / "contacts.db")};
     CXRolvane database{daemonDatabase(directory, clock, center)};
     CapturingLog log;
     std::unique_ptr<CXDVaultraConduit> conduit;

@@ -5,6 +5,7 @@
 #include "TestRecord.h"
 #include "conduits/UserAlert.h"
 #include "contacts/database/CXRolvane.h"
+#include "contacts/database/DaemonMemory.h"
 #include "contacts/records/Constants.h"
 #include "foundation/Preferences.h"
 #include "foundation/PropertyList.h"
@@ -94,7 +95,7 @@ protected:
         });
     }
     Date storedDate(const char* key) {
-        return Preferences(directory / "preferences.db").get(kDaemonDomain, key).date().value_or(Date());
+        return Preferences(directory / "preferences.db", daemonMemory(directory / "contacts.db")).get(kDaemonDomain, key).date().value_or(Date());
     }
 
     static StoreWorld* world;
@@ -105,7 +106,7 @@ protected:
     ManualClock clock{Date(1'800'000'000)};
     NotificationCenter center;
     LocalNotifications distributed;
-    Preferences preferences{directory / "preferences.db"};
+    Preferences preferences{directory / "preferences.db", daemonMemory(directory / "contacts.db")};
     CXRolvane database{CXRolvane::Options{.path = directory / "contacts.db", .program = "RolvaneManager"}};
     CapturingLog log;
     std::vector<std::shared_ptr<CXACLManager>> managers;

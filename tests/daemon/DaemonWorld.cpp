@@ -3,6 +3,7 @@
 #include "conduits/PublishedLayout.h"
 #include "contacts/records/Constants.h"
 #include "contacts/records/Identifier.h"
+#include "contacts/database/DaemonMemory.h"
 #include "engine/memory/EngineState.h"
 #include "foundation/Paths.h"
 #include "foundation/PropertyList.h"
@@ -103,7 +104,7 @@ void DaemonWorld::subscribeFarAway() {
 }
 
 size_t DaemonWorld::pendingChanges() {
-    Preferences preferences(stateDirectory() + "/preferences.db");
+    Preferences preferences(stateDirectory() + "/preferences.db", daemonMemory());
     return EngineState(preferences).getPendingChanges().size();
 }
 

@@ -1,6 +1,7 @@
 #include "DaemonWorld.h"
 
 #include "contacts/records/Identifier.h"
+#include "contacts/database/DaemonMemory.h"
 #include "engine/memory/EngineState.h"
 #include "foundation/Paths.h"
 
@@ -168,7 +169,7 @@ TEST_P(Turbulence, EndsWithTheStoreEqualToTheDatabase) {
     EXPECT_EQ(world.differences(), "") << story.str();
     EXPECT_EQ(strangeGroups(), "");
     EXPECT_EQ(world.pendingChanges(), 0U);
-    Preferences preferences(stateDirectory() + "/preferences.db");
+    Preferences preferences(stateDirectory() + "/preferences.db", daemonMemory());
     EXPECT_FALSE(preferences.get(kDaemonDomain, kCXDUnderWay)) << "nothing is looked at again for ever";
 }
 

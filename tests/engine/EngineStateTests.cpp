@@ -53,29 +53,6 @@ TEST(EngineMemory, WhatIsReadIsACopyThatCanBeChangedWithoutAnyWrite) {
     EXPECT_TRUE(state.conduitObjectForKey("CXDLocal", "priorState").empty());
 }
 
-TEST(EngineMemory, AnIntentIsCarriedOutByTheNextRunWhenTheDatabaseWasSavedAndMeansNothingOtherwise) {
-    for (const bool saved : {true, false}) {
-        World world;
-        world.start();
-        EngineState state(world.preferences);
-        state.setConduitObjectForKey("CXDLocal", Dictionary{{"a", 1}}, "state");
-        state.intendConduitData(world.rolvane->historyMark());
-        if (saved) {
-            world.rolvane->addRecord(CXPerson::create());
-            world.rolvane->save();
-        } else { // somebody else's save says nothing
-            const auto other = world.application();
-            other->addRecord(CXPerson::create());
-            other->save();
-        }
-        EngineState next(world.preferences); // the run ended here
-        next.recoverConduitData([&](const Dictionary& mark) { return world.rolvane->hasSavedSince(mark); },
-                                [](Dictionary&, const Array&) { FAIL() << "nothing was saved in the middle"; });
-        EXPECT_EQ(next.conduitObjectForKey("CXDLocal", "state").empty(), !saved);
-        EXPECT_FALSE(world.stored("CXDConduitDataIntent"));
-    }
-}
-
 TEST(EngineMemory, AMappingWithOneOfItsTwoEndsMissingChangesNothing) {
     World world;
     world.start();
@@ -118,8 +95,8 @@ TEST(EngineMemory, AQueueThatCannotBeReadIsEmptyAndNothingIsLogged) {
     }
     world.preferences.synchronize(kDaemonDomain);
     sqlite3* file = nullptr;
-    ASSERT_EQ(sqlite3_open(world.preferences.path().c_str(), &file), SQLITE_OK);
-    EXPECT_EQ(sqlite3_exec(file, "UPDATE preferences SET value = x'ffff' WHERE key = 'CXDPendingChanges'", nullptr,
+    ASSERT_EQ(sqlite3_open(world.rolvane->path().c_str(), &file), SQLITE_OK);
+    EXPECT_EQ(sqlite3_exec(file, "UPDATE daemon SET value = x'ffff' WHERE key = 'CXDPendingChanges'", nullptr,
                            nullptr, nullptr),
               SQLITE_OK);
     EXPECT_EQ(sqlite3_changes(file), 1);

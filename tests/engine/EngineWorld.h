@@ -3,7 +3,9 @@
 #include "Records.h"
 #include "conduits/CXDConduit.h"
 #include "contacts/database/CXRolvane.h"
+#include "contacts/database/DaemonMemory.h"
 #include "engine/CXDSyncEngine.h"
+#include "engine/memory/EngineState.h"
 #include "foundation/Preferences.h"
 #include "foundation/RunLoop.h"
 #include "model/RemoteLocationMap.h"
@@ -251,7 +253,11 @@ public:
         options.center = &applicationCenter;
         return std::make_unique<CXRolvane>(options);
     }
-    Value stored(const char* key) const { return preferences.get(kDaemonDomain, key); }
+    Value stored(const char* key) {
+        if (key != std::string_view(kCXDConduitData)) return preferences.get(kDaemonDomain, key);
+        const Dictionary data = EngineState(preferences).conduitData(); // which is stored in rows
+        return data.empty() ? Value() : Value(data);
+    }
     std::vector<std::string> pending() {
         std::vector<std::string> names;
         for (const CXDChangeRecordPtr& r : engine->getPendingChanges())
@@ -267,7 +273,7 @@ public:
     ManualClock clock{Date(1000000)};
     NotificationCenter center, applicationCenter;
     LocalNotifications distributed;
-    Preferences preferences{root + "/state/preferences.db"};
+    Preferences preferences{root + "/state/preferences.db", daemonMemory(root + "/contacts.db")};
     RunLoop loop;
     Events events;
     RecordingProgress progress{events};

@@ -1,6 +1,7 @@
 #pragma once
 
 #include "../store/StoreWorld.h"
+#include "contacts/database/DaemonMemory.h"
 #include "EngineWorld.h"
 #include "conduits/UserAlert.h"
 #include "conduits/WithdrawalNotice.h"
@@ -186,7 +187,7 @@ public:
     const std::string base;
     NotificationCenter center, applicationCenter;
     LocalNotifications distributed;
-    Preferences preferences{directory / "preferences.db"};
+    Preferences preferences{directory / "preferences.db", daemonMemory(directory / "contacts.db")};
     RunLoop loop;
     ClockAhead clock; // the engine's
     NoProgress progress;

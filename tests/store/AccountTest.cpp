@@ -243,7 +243,7 @@ TEST(VersionMemory, KnowsWhatWasReadInAnotherRunAndForgetsDamage) {
     {
         VersionMemory m(directory / "v");
         m.read("u", v);
-        m.save();
+        m.save({7, 3});
     }
     VersionMemory again(directory / "v");
     EXPECT_TRUE(again.knows("u", v));
@@ -252,6 +252,40 @@ TEST(VersionMemory, KnowsWhatWasReadInAnotherRunAndForgetsDamage) {
     EXPECT_FALSE(again.knows("w", v));
     std::filesystem::resize_file(directory / "v", 17);
     EXPECT_FALSE(VersionMemory(directory / "v").knows("u", v));
+}
+
+TEST(VersionMemory, CountsForTheDatabaseThatHasWhatWasReadAndNotForAnEarlierStateOfIt) {
+    TempDirectory directory;
+    const FileVersion v{EntityTag("\"a\""), Date(1000), 5};
+    const VersionMemory::Owner then{7, 3};
+    VersionMemory(directory / "unused").belongTo(then);
+    {
+        VersionMemory m(directory / "v");
+        m.belongTo({7, 2});
+        m.read("u", v);
+        m.save(then);
+    }
+    const auto isKnownTo = [&](const VersionMemory::Owner& owner) {
+        VersionMemory m(directory / "v");
+        m.belongTo(owner);
+        return m.knows("u", v);
+    };
+    EXPECT_TRUE(isKnownTo(then));
+    EXPECT_TRUE(isKnownTo({7, 9})) << "a process was killed before it saved the memory";
+    EXPECT_FALSE(isKnownTo({7, 2})) << "a backup that was put back";
+    EXPECT_FALSE(isKnownTo({8, 3})) << "another database";
+}
+
+TEST(VersionMemory, GoesBackToWhatWasSavedLast) {
+    TempDirectory directory;
+    const FileVersion v{EntityTag("\"a\""), Date(1000), 5};
+    VersionMemory m(directory / "v");
+    m.read("saved", v);
+    m.save({7, 3});
+    m.read("not saved", v);
+    m.revert();
+    EXPECT_TRUE(m.knows("saved", v));
+    EXPECT_FALSE(m.knows("not saved", v));
 }
 
 TEST(VersionMemory, AWriteWithoutATagIsKnownBySizeAndServerDate) {

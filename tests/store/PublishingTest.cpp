@@ -317,7 +317,7 @@ TEST(VersionsOfFiles, AreKnownToTheNextRunWhenTheyWereSavedAndNotBecauseTheClien
         auto client = run();
         EXPECT_TRUE(client->dictionaryAtURL(alice.at("Friends"), nullptr, false));
         ASSERT_TRUE(client->remembersVersion(alice.at("Friends")));
-        if (isSaved) client->saveVersionMemory();
+        if (isSaved) client->saveVersionMemory("database", 1);
         client.reset();
         EXPECT_EQ(run()->remembersVersion(alice.at("Friends")), isSaved);
     }

@@ -1,4 +1,5 @@
 #include "Daemon.h"
+#include "contacts/database/DaemonMemory.h"
 
 #include "conduits/database/CXDCXConduit.h"
 #include "conduits/store/CXDVaultraConduit.h"
@@ -28,12 +29,11 @@ Daemon::Daemon(const Person& person, const Weather& weather, Report& report)
     : _report(report), _clock(weather.later),
       _wire(std::make_shared<FaultyTransport>(signedIn(person), weather, report)),
       _manager(person.account, _wire, CXDAVManager::VersionsFile{person.directory + "/versions"}),
-      _preferences(person.directory + "/preferences.db"), _end(report), _account(person),
+      _preferences(person.directory + "/preferences.db", daemonMemory(person.database())), _end(report), _account(person),
       _withdrawn(person.directory + "/withdrawn"), _login(person.account.user.str() + "login") {
     guarded([&] {
         _database = std::make_unique<CXRolvane>(CXRolvane::Options{
             .path = person.database(), .program = "RolvaneManager", .center = &_center, .runLoop = &_loop});
-        _database->recoverShareCount(_preferences);
         _engine = std::make_unique<CXDSyncEngine>(EngineCollaborators{
             .rolvane = *_database,
             .preferences = _preferences,

@@ -131,7 +131,6 @@ private:
         Date since;
     };
 
-    void saveInThePass();
     Dictionary priorState() const;
     ChangeCapture newCapture() const;
     bool forgetWhatIsPublishedAgain(); // true: there is something

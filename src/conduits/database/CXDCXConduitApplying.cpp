@@ -47,13 +47,8 @@ bool saysNothing(const CXDChangeRecord& record, const Dictionary& content) {
 bool CXDCXConduit::applyChangeRecord(const CXDChangeRecordPtr& record, bool* /*denied*/) {
     const bool done = dispatch(record);
     // Most passes are one save. What is saved early is safe: applied again after a crash it changes nothing.
-    if (rolvane().unsavedSize() > kMostUnsaved) saveInThePass();
+    if (rolvane().unsavedSize() > kMostUnsaved) engine().saveInThePass();
     return done;
-}
-
-void CXDCXConduit::saveInThePass() {
-    engine().willSaveInThePass();
-    rolvane().save();
 }
 
 bool CXDCXConduit::dispatch(const CXDChangeRecordPtr& record) {
@@ -232,7 +227,7 @@ bool CXDCXConduit::createStructureForGroup(const CXDChangeRecordPtr& record) {
     if (!group->setValue(content[kCXGroupNameProperty], kCXGroupNameProperty) && there)
         group->setValue(Value(there->name()), kCXGroupNameProperty);
     rolvane().addRecord(group);
-    saveInThePass();
+    engine().saveInThePass();
     return true;
 }
 

@@ -117,6 +117,7 @@ void CXDVaultraConduit::open() {
     if (_serverDate.valid()) _serverDate.wait(); // of a pass that failed
     _serverDate = {};
     _world.manager.expectNothing();
+    _world.manager.useVersionMemoryOf(database().databaseIdentity(), database().shareCount());
     _writes.giveUpMerged(); // of a pass that failed
     _setBack.clear();
     _publishesAgain = !engine().conduitObjectForKey(kConduitCX, kPublishAgain).empty();
@@ -150,7 +151,6 @@ void CXDVaultraConduit::close() {
     awaitStructure();
     _world.manager.expectNothing();
     if (_vaultraOffLine) return;
-    _world.manager.saveVersionMemory();
     if (isToBePublishedAgain()) return;
     std::optional<Date> now = _serverDate.valid() ? _serverDate.get() : std::nullopt;
     if (!now) now = currentServerDate();
@@ -160,6 +160,14 @@ void CXDVaultraConduit::close() {
     _lastSyncDate = now;
     _world.preferences.set(kDaemonDomain, kLastSyncDateKey, *now);
     _world.preferences.synchronize(kDaemonDomain);
+}
+
+void CXDVaultraConduit::passWasStored() {
+    if (!_vaultraOffLine) _world.manager.saveVersionMemory(database().databaseIdentity(), database().shareCount());
+}
+
+void CXDVaultraConduit::passWasNotStored() {
+    _world.manager.revertVersionMemory();
 }
 
 std::optional<Date> CXDVaultraConduit::currentServerDate() {

@@ -81,6 +81,8 @@ public:
     void willClose() override;
     // The stored last-sync date moves to the server's date; off line, or when the server does not tell it, it stays.
     void close() override;
+    void passWasStored() override;
+    void passWasNotStored() override;
     // The map's manager, else a new one for the location's base location, which the map then keeps. None when the
     // location has no base location.
     std::shared_ptr<CXACLManager> ACLManagerForRemoteLocation(const Url& location) override;

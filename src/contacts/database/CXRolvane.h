@@ -7,6 +7,7 @@
 #include "contacts/records/CXPerson.h"
 #include "contacts/records/CXSubscription.h"
 #include "foundation/Notification.h"
+#include "foundation/Preferences.h"
 #include "foundation/RunLoop.h"
 
 #include <functional>
@@ -16,7 +17,6 @@
 
 namespace rolvane {
 
-class Preferences;
 class SqliteSnapshot;
 
 // One row, read without making a record object. Borrowed for the time of the call that it is handed to; copying is
@@ -157,6 +157,21 @@ public:
     size_t unsavedSize() const; // bytes of content that wait in memory for the save, roughly
     void rollback();            // drops the unsaved changes; handles of records that were only added become empty
 
+    // While it lives, `save` and `advanceCursorTo` are only noted; `commit` carries them out in one transaction,
+    // together with values of the table "daemon" (contacts/database/DaemonMemory.h), and is durable on return. Whether
+    // it fails or is never called: nothing is written, and unsaved changes stay unsaved. One at a time, one thread.
+    class OneCommit {
+    public:
+        explicit OneCommit(CXRolvane& rolvane);
+        ~OneCommit();
+        OneCommit(const OneCommit&) = delete;
+        OneCommit& operator=(const OneCommit&) = delete;
+        void commit(const PreferencesChanges& values);
+
+    private:
+        CXRolvane& _rolvane;
+    };
+
     // Two people's edits of one contact ------------------------------------------------------------------------------
     // From the first edit of a contact that a store has had, until that edit is sent, the database keeps the contact as
     // both had it (contacts/records/ContactMerge.h merges against that). An edit is every save but one that says itself
@@ -186,18 +201,10 @@ public:
     // Changes only by setShareCount; part of the unit of work like a property.
     int64_t shareCount();
     void setShareCount(int64_t count);
-    // Share count + 1, into the preferences ("CXDShareCount" of the daemon's domain, synchronised at once together with
-    // everything else unsynchronised of that domain) and into the database (`save`), so that no crash can separate the
-    // two: an intent in the preferences covers the time between the two writes. Gives the new count.
-    int64_t bumpShareCount(Preferences& preferences);
-    // Where the database is in its history, for what has to be put down in another file before a `save`: a mark to be
-    // stored there, and whether this program has saved to this very database since.
+    // Where the database is in its history, to be kept elsewhere, and whether it has gone on from there: false for
+    // another database, and for an earlier copy of this one.
     Dictionary historyMark();
-    bool hasSavedSince(const Dictionary& mark);
-    bool isOfHistory(const Dictionary& mark); // false for another database, and for an earlier copy of this one
-    // At the daemon's start, before any check of the share count: completes a bump that a crash interrupted, if the
-    // database still is the one that the intent was made for. Any other database keeps its own count and thus differs.
-    void recoverShareCount(Preferences& preferences);
+    bool isOfHistory(const Dictionary& mark);
 
     // Other processes' saves -------------------------------------------------------------------------------------
     // With a run loop, a waking (bus signal or file watch) calls deliverExternalChanges from the loop by itself.

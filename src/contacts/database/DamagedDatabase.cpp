@@ -13,7 +13,7 @@
 namespace rolvane {
 namespace {
 
-constexpr const char* kShareCountKey = "CXDShareCount"; // what the daemon remembers counts for a database of this count
+constexpr const char* kShareCountKey = "CXDShareCount"; // stood in the preferences in earlier versions
 
 constexpr const char* kWhatToDo =
     "Stop RolvaneManager (`rolvane daemon stop`), move the file away and put a backup of it in its place; or save what "
@@ -118,7 +118,9 @@ void requireKnownDatabase(const std::string& given, const Preferences& preferenc
                           "The contact database " + path +
                               " is empty (0 bytes): what stood in it is lost. Nothing was deleted on the store nor for "
                               "readers. Put a backup in its place, or begin anew with `rolvane new-database`.");
-    if (!preferences.get(kDaemonDomain, kShareCountKey)) return; // nothing was ever shared
+    const bool wasShared =
+        preferences.get(kDaemonDomain, kCXDKnownDatabase) || preferences.get(kDaemonDomain, kShareCountKey);
+    if (!wasShared) return;
     throw CXException(
         kCXDatabaseException,
         "The contact database " + path +

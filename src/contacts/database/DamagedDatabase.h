@@ -57,9 +57,11 @@ std::string damageOf(CXRolvane& rolvane);
 // as it was, when that is not so, and says what to do. Costs seconds where there are 50,000 contacts.
 void repairDatabase(CXRolvane& rolvane);
 
-// Throws kCXDatabaseException when there is no file though the daemon's memory in the preferences knows of one, and
-// when the file is empty. To be asked before the database is opened, which would make a new one. "": the path is the
-// default.
+// In the daemon's preferences, from its first pass on: the identity of the database that it has shared contacts of.
+inline constexpr const char* kCXDKnownDatabase = "CXDKnownDatabase";
+
+// Throws kCXDatabaseException when there is no file though the preferences know of one, and when the file is empty. To
+// be asked before the database is opened, which would make a new one. "": the path is the default.
 void requireKnownDatabase(const std::string& path, const Preferences& preferences);
 
 // Puts a new database in the place of one that is gone or empty, on purpose; an empty file is kept under another name.

@@ -86,15 +86,6 @@ bool Journal::hasToken(const std::string& token) {
     return _database.statement("SELECT 1 FROM saves WHERE token=?").bind(1, token).step();
 }
 
-int64_t Journal::latestSave() {
-    return _database.integer("SELECT coalesce(max(id), 0) FROM saves");
-}
-
-bool Journal::hasSaveOf(const std::string& program, int64_t after) {
-    auto s = _database.statement("SELECT 1 FROM saves WHERE program=? AND id>?");
-    return s.bind(1, program).bind(2, after).step();
-}
-
 int64_t Journal::beginSave(int64_t processID, const std::string& program, Date date) {
     auto s = _database.statement("INSERT INTO saves(pid, program, date, token) VALUES(?,?,?,hex(randomblob(16)))");
     s.bind(1, processID).bind(2, program).bind(3, date.secondsSince1970()).run();

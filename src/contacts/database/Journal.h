@@ -29,8 +29,6 @@ public:
 
     std::string latestToken(); // "" before the first save
     bool hasToken(const std::string& token);
-    int64_t latestSave(); // 0 before the first
-    bool hasSaveOf(const std::string& program, int64_t after);
 
     // Within a transaction.
     int64_t beginSave(int64_t processID, const std::string& program, Date date);

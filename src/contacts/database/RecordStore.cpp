@@ -2,6 +2,7 @@
 
 #include "contacts/database/CommonVersions.h"
 #include "contacts/database/ConflictLog.h"
+#include "contacts/database/DaemonMemory.h"
 #include "contacts/database/DamagedDatabase.h"
 #include "foundation/Paths.h"
 #include "foundation/PropertyList.h"
@@ -21,7 +22,7 @@ namespace rolvane {
 
 namespace {
 
-constexpr int kFormat = 5;
+constexpr int kFormat = 6;
 constexpr int64_t kApplicationId = 0x52564c43; // "RVLC"
 
 constexpr const char* kTables = R"(
@@ -161,6 +162,7 @@ void RecordStore::makeOrCheckFormat() {
     if (format == 2) format = addNames();
     if (format == 3) format = addCommonVersions();
     if (format == 4) format = addDisplayNames();
+    if (format == 5) format = addDaemonMemory();
     if (format > kFormat)
         throw CXException(kCXDatabaseException, "The contact database " + _database.path() +
                                                     " was written by a newer version (format " +
@@ -207,8 +209,17 @@ int64_t RecordStore::addDisplayNames() {
     return _database.integer("PRAGMA user_version");
 }
 
+// Up to format 5 the daemon's memory was in the preferences, from where it moves as it is used.
+int64_t RecordStore::addDaemonMemory() {
+    SqliteTransaction transaction(_database);
+    if (_database.integer("PRAGMA user_version") == 5) // nobody else did it meanwhile
+        _database.execute(std::string(MemoryTable::kTable) + "PRAGMA user_version=6;");
+    transaction.commit();
+    return _database.integer("PRAGMA user_version");
+}
+
 void RecordStore::fillNewDatabase() {
-    _database.execute(std::string(kTables) + CommonVersions::kTable + ConflictLog::kTable);
+    _database.execute(std::string(kTables) + CommonVersions::kTable + ConflictLog::kTable + MemoryTable::kTable);
     _database.execute("PRAGMA application_id=" + std::to_string(kApplicationId));
     _database.execute("PRAGMA user_version=" + std::to_string(kFormat));
     _database.statement("INSERT INTO meta VALUES('identity', ?)").bind(1, makeUUID()).run();

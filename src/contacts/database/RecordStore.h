@@ -131,6 +131,7 @@ private:
     int64_t addNames();
     int64_t addCommonVersions();
     int64_t addDisplayNames();
+    int64_t addDaemonMemory();
     void fillNewDatabase();
     [[noreturn]] void outOfOrder();
     std::vector<CXRow> rowsWithParents(Sqlite::Statement& s, int positionColumn, int64_t& position);

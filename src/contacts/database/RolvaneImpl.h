@@ -41,6 +41,8 @@ struct CXRolvane::Impl {
         Date since;
     };
     std::vector<Scanned> scans; // ahead of the cursor
+    bool oneCommit = false;        // a OneCommit lives
+    std::optional<Scanned> moveTo; // of the cursor, with that commit
     std::unique_ptr<ChangeWatcher> watcher;
 
     // CXException when the path names another file by now: what is read is of the past, what is saved would be lost.
@@ -87,8 +89,10 @@ struct CXRolvane::Impl {
     void setChoice(const UniqueId& group, const UniqueId& person, const std::string& property,
                    const std::optional<std::string>& identifier);
     bool save(const std::vector<CXExpected>& expected = {}); // false: a record is not as expected
+    bool saveWith(const PreferencesChanges& values, const std::vector<CXExpected>& expected);
 
     int64_t cursor(); // registers the program's cursor when there is none
+    void advanceCursor(const Scanned& scan);
 
 private:
     PendingRecord& pending(const UniqueId& uid);

@@ -1,5 +1,6 @@
 // One save: one transaction, one journal entry a record, one signal.
 
+#include "contacts/database/DaemonMemory.h"
 #include "contacts/database/RolvaneImpl.h"
 #include "contacts/records/ContactMerge.h"
 
@@ -230,10 +231,31 @@ void CXRolvane::Impl::requireSameFile() const {
 }
 
 bool CXRolvane::Impl::save(const std::vector<CXExpected>& expected) {
-    if (work.empty() && expected.empty()) return true;
+    if (oneCommit || (work.empty() && expected.empty())) return true;
+    return saveWith({}, expected);
+}
+
+CXRolvane::OneCommit::OneCommit(CXRolvane& rolvane) : _rolvane(rolvane) {
+    std::lock_guard lock(_rolvane._impl->mutex);
+    _rolvane._impl->oneCommit = true;
+}
+
+CXRolvane::OneCommit::~OneCommit() {
+    std::lock_guard lock(_rolvane._impl->mutex);
+    _rolvane._impl->oneCommit = false;
+    _rolvane._impl->moveTo.reset();
+}
+
+void CXRolvane::OneCommit::commit(const PreferencesChanges& values) {
+    std::lock_guard lock(_rolvane._impl->mutex);
+    _rolvane._impl->saveWith(values, {});
+}
+
+bool CXRolvane::Impl::saveWith(const PreferencesChanges& values, const std::vector<CXExpected>& expected) {
     requireSameFile();
+    const std::vector<Scanned> scansBefore = scans;
     bool changedRecords;
-    {
+    try {
         SqliteTransaction transaction(sqlite);
         for (const auto& [uid, when] : expected) {
             const std::optional<StoredRow> row = store.row(uid);
@@ -241,9 +263,15 @@ bool CXRolvane::Impl::save(const std::vector<CXExpected>& expected) {
         }
         Saver saver(*this, clock.now());
         saver.write(work);
+        MemoryTable(sqlite).write(values);
+        if (moveTo) advanceCursor(*moveTo);
         transaction.commit();
         changedRecords = saver.changedRecords();
+    } catch (...) {
+        scans = scansBefore;
+        throw;
     }
+    moveTo.reset();
     work.clear();
     store.noteOwnWrite();
     if (!changedRecords) return true;

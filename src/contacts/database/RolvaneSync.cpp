@@ -1,7 +1,6 @@
 // What the daemon needs beyond records: the share count and other processes' saves.
 
 #include "contacts/database/RolvaneImpl.h"
-#include "contacts/database/ShareCountBump.h"
 
 #include <algorithm>
 #include <unistd.h>
@@ -26,19 +25,9 @@ void CXRolvane::setShareCount(int64_t count) {
     _impl->work.setShareCount(count);
 }
 
-int64_t CXRolvane::bumpShareCount(Preferences& preferences) {
-    std::lock_guard lock(_impl->mutex);
-    ShareCountBump bump(*this, preferences);
-    int64_t count = bump.writeIntent();
-    bump.writeDatabase(count);
-    bump.clearIntent();
-    return count;
-}
-
 Dictionary CXRolvane::historyMark() {
     std::lock_guard lock(_impl->mutex);
     return {{"identity", databaseIdentity()},
-            {"save", _impl->journal.latestSave()},
             {"token", _impl->journal.latestToken()}};
 }
 
@@ -46,16 +35,6 @@ bool CXRolvane::isOfHistory(const Dictionary& mark) {
     std::lock_guard lock(_impl->mutex);
     const std::string& token = mark["token"].string();
     return mark["identity"].string() == databaseIdentity() && (token.empty() || _impl->journal.hasToken(token));
-}
-
-bool CXRolvane::hasSavedSince(const Dictionary& mark) {
-    std::lock_guard lock(_impl->mutex);
-    return isOfHistory(mark) && _impl->journal.hasSaveOf(_impl->options.program, mark["save"].integer());
-}
-
-void CXRolvane::recoverShareCount(Preferences& preferences) {
-    std::lock_guard lock(_impl->mutex);
-    ShareCountBump(*this, preferences).recover();
 }
 
 void CXRolvane::keepFormerVersions() {
@@ -206,14 +185,22 @@ int64_t CXRolvane::cursorPosition(const std::string& program) {
 
 void CXRolvane::advanceCursorTo(int64_t position, Date scannedSince) {
     std::lock_guard lock(_impl->mutex);
-    int64_t from = _impl->cursor();
-    std::optional<int64_t> missed =
-        _impl->journal.firstForeignNotAfter(from, position, _impl->options.program, scannedSince);
-    int64_t to = missed ? *missed - 1 : position;
-    if (to > from) _impl->journal.setCursor(_impl->options.program, to);
+    const Impl::Scanned scan{position, scannedSince};
+    if (_impl->oneCommit)
+        _impl->moveTo = scan;
+    else
+        _impl->advanceCursor(scan);
+}
+
+void CXRolvane::Impl::advanceCursor(const Scanned& scan) {
+    const int64_t from = cursor();
+    const std::optional<int64_t> missed =
+        journal.firstForeignNotAfter(from, scan.position, options.program, scan.since);
+    const int64_t to = missed ? *missed - 1 : scan.position;
+    if (to > from) journal.setCursor(options.program, to);
     // Several scans may come before the journal is read again, each with entries of its own that it has captured.
-    std::erase_if(_impl->scans, [&](const Impl::Scanned& scan) { return scan.position <= to; });
-    if (missed) _impl->scans.push_back({position, scannedSince});
+    std::erase_if(scans, [&](const Scanned& former) { return former.position <= to; });
+    if (missed) scans.push_back(scan);
 }
 
 std::vector<UniqueId> CXRolvane::changedByOthers(int64_t after, int64_t until) {

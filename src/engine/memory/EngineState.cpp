@@ -21,8 +21,11 @@ constexpr const char* kRecordClass = "CXDChangeRecord";
 
 Dictionary EngineState::loadedConduitData() {
     if (!_conduitData) {
-        const Value stored = _preferences.get(kDaemonDomain, kCXDConduitData);
-        _conduitData = stored.isDictionary() ? stored.deepMutableCopy().dictionary() : Dictionary();
+        _stored.clear();
+        for (const std::string& key : _preferences.keys(kDaemonDomain))
+            if (isStateRow(key)) _stored.emplace(key, _preferences.get(kDaemonDomain, key));
+        _putAll = false;
+        _conduitData = joinedRows(_stored);
     }
     return *_conduitData;
 }
@@ -54,45 +57,57 @@ void EngineState::setConduitObjectForKey(const std::string& conduitID, const Val
 }
 
 void EngineState::putConduitData() {
-    _preferences.set(kDaemonDomain, kCXDConduitData, conduitData());
-    _preferences.remove(kDaemonDomain, kCXDConduitDataIntent);
-    _preferences.remove(kDaemonDomain, kCXDArrivalsIntent);
+    const std::lock_guard guard(_lock);
+    put(stateRows(loadedConduitData()));
 }
 
-void EngineState::intendConduitData(const Dictionary& mark) {
-    _preferences.set(kDaemonDomain, kCXDConduitDataIntent, Dictionary{{"data", conduitData()}, {"mark", mark}});
-    _preferences.synchronize(kDaemonDomain);
-}
-
-void EngineState::dropIntent() {
-    _preferences.remove(kDaemonDomain, kCXDConduitDataIntent);
-    _preferences.synchronize(kDaemonDomain);
-}
-
-void EngineState::intendArrivals(const Dictionary& mark, const Array& arrivals) {
-    _preferences.set(kDaemonDomain, kCXDArrivalsIntent,
-                     Dictionary{{"data", conduitData()}, {"mark", mark}, {"arrivals", arrivals}});
-    _preferences.synchronize(kDaemonDomain);
-}
-
-void EngineState::recoverConduitData(const std::function<bool(const Dictionary& mark)>& hasSavedSince,
-                                     const std::function<void(Dictionary& data, const Array& arrivals)>& fold) {
-    const Dictionary whole = _preferences.get(kDaemonDomain, kCXDConduitDataIntent).dictionary();
-    const Dictionary part = _preferences.get(kDaemonDomain, kCXDArrivalsIntent).dictionary();
-    if (whole.empty() && part.empty()) return;
-    const auto counts = [&](const Dictionary& intent) {
-        return intent["data"].isDictionary() && hasSavedSince(intent["mark"].dictionary());
-    };
-    if (counts(whole)) {
-        _preferences.set(kDaemonDomain, kCXDConduitData, whole["data"]);
-    } else if (counts(part)) {
-        Dictionary data = part["data"].deepMutableCopy().dictionary();
-        fold(data, part["arrivals"].array());
-        _preferences.set(kDaemonDomain, kCXDConduitData, data);
+void EngineState::putConduitDataWith(const Dictionary& marks) {
+    const std::lock_guard guard(_lock);
+    Dictionary data = loadedConduitData().mutableCopy();
+    Dictionary cx = data[kConduitCX].dictionary().mutableCopy();
+    for (const auto& [key, before] : marks) {
+        Dictionary both = before.dictionary().mutableCopy();
+        both.addEntriesFrom(cx[key].dictionary());
+        cx.set(key, both);
     }
-    dropConduitData();
-    _preferences.remove(kDaemonDomain, kCXDArrivalsIntent);
-    dropIntent();
+    if (!marks.empty()) data.set(kConduitCX, cx);
+    put(stateRows(data));
+}
+
+Dictionary EngineState::marks() {
+    const std::lock_guard guard(_lock);
+    const Dictionary cx = loadedConduitData()[kConduitCX].dictionary();
+    Dictionary marks;
+    for (const char* key : {kUnsettledGroups, kUnsettledPeople})
+        if (!cx[key].dictionary().empty()) marks.set(key, cx[key].deepMutableCopy());
+    return marks;
+}
+
+void EngineState::forgetPut() noexcept {
+    const std::lock_guard guard(_lock);
+    _putAll = true;
+}
+
+void EngineState::put(const StateRows& rows) {
+    if (_putAll) {
+        _stored.clear();
+        for (const std::string& key : _preferences.keys(kDaemonDomain))
+            if (isStateRow(key)) _stored.emplace(key, Value()); // equal to none
+        _putAll = false;
+    }
+    for (auto stored = _stored.begin(); stored != _stored.end();)
+        if (rows.contains(stored->first)) {
+            ++stored;
+        } else {
+            _preferences.remove(kDaemonDomain, stored->first);
+            stored = _stored.erase(stored);
+        }
+    for (const auto& [key, value] : rows) {
+        Value& stored = _stored[key];
+        if (stored == value) continue;
+        _preferences.set(kDaemonDomain, key, value);
+        stored = value.deepMutableCopy();
+    }
 }
 
 void EngineState::syncPrefs() {
@@ -111,7 +126,7 @@ CXDChangeRecords EngineState::getPendingChanges() const {
         });
     } catch (const CXException& e) {
         // What does not unarchive is no queue. A file that cannot be read just now is something else: its queue stays.
-        if (e.name() == kCXPreferencesException) throw;
+        if (e.name() == kCXPreferencesException || e.name() == kCXDatabaseException) throw;
         records.clear();
     }
     return records;
@@ -243,8 +258,10 @@ void EngineState::reset() {
     CXDLog("Reset!");
     for (const char* key : {kCXDPendingChanges, kCXDConduitData, kCXDVaultraConduitLastSyncDate,
                             kCXDCXConduitLastSyncDate, kCXDLocalConduitLastSyncDate, kCXDShareCount, kCXDLastOstrelUser,
-                            kCXDConduitDataIntent, kCXDArrivalsIntent, kCXDUnderWay})
+                            kCXDUnderWay})
         _preferences.remove(kDaemonDomain, key);
+    for (const std::string& key : _preferences.keys(kDaemonDomain))
+        if (isStateRow(key)) _preferences.remove(kDaemonDomain, key);
     _preferences.synchronize(kDaemonDomain);
     dropConduitData();
 }

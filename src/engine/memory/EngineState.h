@@ -1,5 +1,6 @@
 #pragma once
 
+#include "engine/memory/StateRows.h"
 #include "foundation/Preferences.h"
 #include "foundation/StrongString.h"
 #include "foundation/Value.h"
@@ -17,8 +18,6 @@ namespace rolvane {
 // Keys of the daemon's domain.
 inline constexpr const char* kCXDPendingChanges = "CXDPendingChanges";
 inline constexpr const char* kCXDConduitData = "CXDConduitData";
-inline constexpr const char* kCXDConduitDataIntent = "CXDConduitDataIntent";
-inline constexpr const char* kCXDArrivalsIntent = "CXDArrivalsIntent";
 inline constexpr const char* kCXDUnderWay = "CXDUnderWay"; // engine/recovery/UnderWay.h
 inline constexpr const char* kCXDVaultraConduitLastSyncDate = "CXDVaultraConduitLastSyncDate";
 inline constexpr const char* kCXDCXConduitLastSyncDate = "CXDCXConduitLastSyncDate";
@@ -34,7 +33,8 @@ inline constexpr const char* kRefusedChanges = "changes"; // how many
 inline constexpr const char* kRefusedWhy = "why";         // as Refusal has them; missing when empty
 inline constexpr const char* kRefusedGroup = "group";
 
-// The engine's memory: the conduit data and the queue, in the daemon's preferences. The conduit data is read on first
+// The engine's memory: the conduit data and the queue, in the daemon's domain of the preferences, which keep it in the
+// contact database's own file (contacts/database/DaemonMemory.h). The conduit data is read on first
 // need and lives in memory until it is dropped. Finding a conduit's dictionary is safe on any thread; the dictionaries
 // that are found are shared and have no lock. Everything else on the main thread.
 class EngineState {
@@ -46,19 +46,13 @@ public:
     void withConduitData(const std::function<void(Dictionary&)>& use);
     Dictionary conduitObjectForKey(const std::string& conduitID, const std::string& key); // made empty when absent
     void setConduitObjectForKey(const std::string& conduitID, const Value& object, const std::string& key);
-    void putConduitData(); // without synchronising
-    // Puts down durably what the conduit data will be once the contact database has been saved: the next
-    // putConduitData takes its place. `mark` is the database's historyMark before that save.
-    void intendConduitData(const Dictionary& mark);
-    void dropIntent();
-    // The same before a save in the middle of a pass, which puts a part of the arrivals (engine/recovery/Arrivals.h) on
-    // the disk together with what the conduit data says already. Good for all later saves of the pass, until
-    // putConduitData.
-    void intendArrivals(const Dictionary& mark, const Array& arrivals);
-    // At the daemon's start, and when a pass could not save, before the conduit data is used: a pass that ended between
-    // such a save and putConduitData has its intent carried out; what is meant for a save that never came is dropped.
-    void recoverConduitData(const std::function<bool(const Dictionary& mark)>& hasSavedSince,
-                            const std::function<void(Dictionary& data, const Array& arrivals)>& fold);
+    // Sets what has changed of it since it was read or put last, without synchronising.
+    void putConduitData();
+    // The same in the middle of a pass: of what a scan of this pass has taken out of the marks (kUnsettledGroups,
+    // kUnsettledPeople) as much as was there before counts as being there still.
+    void putConduitDataWith(const Dictionary& marks);
+    Dictionary marks();         // copies
+    void forgetPut() noexcept; // what was put since the last synchronising was dropped: the next put sets it all anew
     void syncPrefs(); // putConduitData, then synchronise
 
     // A queue that cannot be read is empty.
@@ -97,10 +91,13 @@ public:
 
 private:
     Dictionary loadedConduitData(); // with _lock held
+    void put(const StateRows& rows);
 
     Preferences& _preferences;
     std::mutex _lock;
-    std::optional<Dictionary> _conduitData; // guarded by _lock, as is
+    std::optional<Dictionary> _conduitData; // guarded by _lock, as are the next three
+    StateRows _stored;                      // as the preferences have them, set or synchronised
+    bool _putAll = false;                   // they may have others
     std::vector<Refusal> _refused;
 };
 

@@ -1,15 +1,16 @@
 #include "engine/pass/ApplyLoop.h"
 
 #include "contacts/database/CXRolvane.h"
+#include "contacts/database/DamagedDatabase.h"
 #include "contacts/records/Constants.h"
 #include "contacts/records/Identifier.h"
+#include "engine/memory/PassCommit.h"
 #include "engine/memory/PublicationCache.h"
 #include "engine/pass/OutOfOrderWork.h"
 #include "engine/queue/ChangeQueue.h"
 #include "engine/queue/Mingler.h"
 #include "engine/queue/RecordIdentity.h"
 #include "engine/queue/RefusedChanges.h"
-#include "engine/recovery/Arrivals.h"
 #include "engine/recovery/GoneThings.h"
 #include "engine/recovery/Holdings.h"
 #include "engine/recovery/UnderWay.h"
@@ -81,19 +82,6 @@ private:
     std::vector<size_t> _positions;    // of the records that read something
 };
 
-class NotingArrivals {
-public:
-    NotingArrivals(EngineParts& parts, std::function<void()> note) : _parts(parts) {
-        _parts.beforeSaveInThePass = std::move(note);
-    }
-    ~NotingArrivals() { _parts.beforeSaveInThePass = {}; }
-    NotingArrivals(const NotingArrivals&) = delete;
-    NotingArrivals& operator=(const NotingArrivals&) = delete;
-
-private:
-    EngineParts& _parts;
-};
-
 } // namespace
 
 bool isGivenUp(EngineParts& parts, const CXDChangeRecord& record) {
@@ -133,11 +121,14 @@ void ApplyLoop::run(CXDChangeRecords records, bool trickle, bool allowRetry) {
     } catch (const CXException& e) {
         CXLog("applyChangeRecords close: Caught %@: %@", e.name(), e.reason());
         _parts.outcomes.couldNotStore(e.reason());
-        if (trickle && !_queueStored) notStored = std::current_exception();
+        _parts.with.rolvane.rollback();
+        _parts.state.dropConduitData();
+        _parts.conduits.vaultra->passWasNotStored();
+        if (trickle) notStored = std::current_exception();
     }
+    _parts.marksOfThePass = {};
     _parts.denied.clear(); // also when nothing could be stored: what comes again is to be asked again
     _parts.revoked.clear();
-    bumpShareCount();
     _parts.with.progress.stop();
     _actions.persist();
     // Whoever handed the changes over still has them, and must not take them for done. A full pass finds its own again.
@@ -267,11 +258,11 @@ void ApplyLoop::takeInMerged() {
 void ApplyLoop::applyInOrder() {
     constexpr size_t kFew = 50;
     const ReadingAhead ahead(_inOrder);
-    const NotingArrivals noting(_parts, [this] { noteArrivals(); });
     for (; _inOrderDone < _inOrder.size(); ++_inOrderDone) {
         const CXDChangeRecordPtr record = _inOrder[_inOrderDone]; // there may be more on the way
         if (_inOrderDone == ahead.lastBut(kFew) && !_parts.terminating) _parts.conduits.vaultra->willClose();
         applyInOrder(record);
+        saveInThePass();
         ++_processedCount;
         _parts.with.progress.didProcessChangeRecord(record);
     }
@@ -307,11 +298,37 @@ bool ApplyLoop::isOfWhatWasTakenOutHere(const CXDChangeRecord& record) {
     return !_refusedUsers->contains(record.user().value_or(UserName()));
 }
 
-// Once a pass: what is noted then is good for all saves that follow.
-void ApplyLoop::noteArrivals() {
-    if (std::exchange(_arrivalsNoted, true)) return;
+// The change that asked for it is done, and what is known says so.
+void ApplyLoop::saveInThePass() {
+    if (!std::exchange(_parts.saveInThePass, false)) return;
+    PassCommit commit(_parts.with.rolvane, _parts.with.preferences, _parts.state);
     claimState();
-    _parts.state.intendArrivals(_parts.with.rolvane.historyMark(), arrivalsAmong(_inOrder, _inOrderDone));
+    listArrived();
+    _parts.state.putConduitDataWith(_parts.marksOfThePass);
+    commit.commit();
+}
+
+// Whoever is in the database is in its list of all as well. The change that says so comes later in the pass: were it
+// killed in between, the next one would take them for the user's own.
+void ApplyLoop::listArrived() {
+    if (!_listings) {
+        _listings.emplace();
+        for (size_t i = _inOrderDone; i < _inOrder.size(); ++i) {
+            const CXDChangeRecord& record = *_inOrder[i];
+            const bool lists = record.type() == CXDAddRecordToGroup || record.type() == CXDAddGroupToGroup;
+            if (lists && (record.appliesToSources() & CXDSyncSourceCX) && record.initialSource() != CXDSyncSourceCX &&
+                record.user() && record.person() && record.group() &&
+                cxUIDWithTableName(*record.group(), kCXGroupTable).str() == kCXAllGroupUID)
+                _listings->emplace(std::pair(*record.user(), cxNormalizedUID(*record.person())), _inOrder[i]);
+        }
+    }
+    for (const CXDChangeRecordPtr& record : std::exchange(_arrived, {})) {
+        const UniqueId& who = record->type() == CXDUpdateRecord ? *record->person() : *record->group();
+        const auto listing = _listings->find({*record->user(), cxNormalizedUID(who)});
+        if (listing == _listings->end() || !_parts.conduits.cx->holds(*listing->second)) continue;
+        _parts.state.withConduitData(
+            [&](Dictionary& data) { didApplyChange(data, *listing->second, CXDSyncSourceCX); });
+    }
 }
 
 // A first pass has this done long before it ends. Killed behind its first save, it would be a first pass again, for
@@ -364,6 +381,10 @@ bool ApplyLoop::applyTo(CXDConduit& conduit, int32_t source, const CXDChangeReco
         forgetRefusedChange(data, *record);
     });
     _parts.outcomes.applied(*record, source);
+    const bool isArrival = record->type() == CXDUpdateRecord ? record->person().has_value()
+                                                             : record->type() == CXDCreateStructureForGroup &&
+                                                                   record->group().has_value();
+    if (isArrival && source == CXDSyncSourceCX && record->user()) _arrived.push_back(record);
     return true;
 }
 
@@ -445,6 +466,16 @@ void ApplyLoop::carryOver() {
 }
 
 void ApplyLoop::storeAndClose(bool allowRetry) {
+    PassCommit commit(_parts.with.rolvane, _parts.with.preferences, _parts.state);
+    storeQueue(allowRetry);
+    closeConduits();
+    bumpShareCount();
+    commit.commit();
+    _parts.conduits.vaultra->passWasStored();
+    _parts.with.preferences.synchronize(kDaemonDomain); // of the outcome
+}
+
+void ApplyLoop::storeQueue(bool allowRetry) {
     if (!_queueTaken) append(_pendingChanges, _parts.state.getPendingChanges());
     for (const CXDChangeRecordPtr& record : _parts.denied.all())
         if (!isOwnWrite(*record)) _parts.outcomes.refused(record->user().value_or(UserName()));
@@ -452,25 +483,11 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
     CXDLog("Pending: %@", _pendingChanges);
     CXDLog("Denied:  %@", _parts.denied.all());
     _parts.outcomes.leaves(_pendingChanges);
-    // A change leaves the queue only when the database that took it has it on the disk. And what the database took is
-    // known to have come from the store in the same moment: a copy that arrived in a pass which came to no end would be
-    // taken for the user's own addition.
-    CXRolvane& rolvane = _parts.with.rolvane;
-    claimState();
     noteRefused();
-    if (_inOrderDone > 0) _parts.state.intendConduitData(rolvane.historyMark());
-    try {
-        rolvane.save();
-    } catch (...) {
-        _parts.state.dropIntent(); // another save is to mean nothing of it
-        throw;
-    }
     for (const CXDChangeRecordPtr& record : _parts.denied.all()) takeBack(*record);
-    _parts.state.putConduitData();
     _parts.state.setPendingChanges(_pendingChanges);
-    _queueStored = true;
     _end.unsureGroups.merge(groupsOf(ownWrites(_pendingChanges)));
-    _end.everythingIsPublished = isPublished(*rolvane.allGroup());
+    _end.everythingIsPublished = isPublished(*_parts.with.rolvane.allGroup());
     const bool nothingWaits =
         std::all_of(_pendingChanges.begin(), _pendingChanges.end(),
                     [](const CXDChangeRecordPtr& record) { return waitsForTheFolderAlone(*record); });
@@ -481,8 +498,17 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
         _parts.denied.clear();
         if (allowRetry) _actions.scheduleRetry();
     }
-    _parts.conduits.cx->close();
-    _parts.conduits.vaultra->close();
+}
+
+// What was applied counts even where a source cannot be closed.
+void ApplyLoop::closeConduits() {
+    try {
+        _parts.conduits.cx->close();
+        _parts.conduits.vaultra->close();
+    } catch (const CXException& e) {
+        CXLog("applyChangeRecords close: Caught %@: %@", e.name(), e.reason());
+        _parts.outcomes.couldNotStore(e.reason());
+    }
 }
 
 void ApplyLoop::tellRefused() {
@@ -529,31 +555,20 @@ bool ApplyLoop::noteUnsettled() {
     return true;
 }
 
-// Account and conduit data are put down first, so that they reach the disk in one piece with the share count. They
-// never run ahead of the database: what they say it holds and it does not would be taken for the user's own removal.
 void ApplyLoop::bumpShareCount() {
-    const std::optional<UserName> user = _parts.with.account.vaultraUser();
+    CXRolvane& rolvane = _parts.with.rolvane;
     Preferences& preferences = _parts.with.preferences;
-    try {
-        _parts.with.rolvane.save();
-    } catch (const CXException& e) {
-        CXLog("applyChangeRecords: Caught %@: %@", e.name(), e.reason());
-        _parts.outcomes.couldNotStore(e.reason());
-        _parts.state.dropConduitData();
-        recoverConduitData(_parts); // what was saved in the middle of the pass is there
-        return;
-    }
-    try {
-        preferences.set(kDaemonDomain, kCXDLastOstrelUser, user ? Value(*user) : Value());
-        _parts.state.putConduitData();
-        if (_queueStored && _underWay) _parts.state.setUnderWay(adrift(*_underWay, _parts.state.conduitData(), _end));
-        _parts.outcomes.put();
-        _parts.with.rolvane.bumpShareCount(preferences);
-        preferences.synchronize(kDaemonDomain);
-    } catch (const CXException& e) {
-        CXLog("applyChangeRecords: Caught %@: %@", e.name(), e.reason());
-        _parts.outcomes.couldNotStore(e.reason());
-    }
+    const int64_t count = rolvane.shareCount() + 1;
+    preferences.set(kDaemonDomain, kCXDShareCount, count);
+    rolvane.setShareCount(count);
+    rolvane.save();
+    const std::optional<UserName> user = _parts.with.account.vaultraUser();
+    preferences.set(kDaemonDomain, kCXDLastOstrelUser, user ? Value(*user) : Value());
+    if (_underWay) _parts.state.setUnderWay(adrift(*_underWay, _parts.state.conduitData(), _end));
+    _parts.state.putConduitData();
+    if (preferences.get(kDaemonDomain, kCXDKnownDatabase) != Value(rolvane.databaseIdentity()))
+        preferences.set(kDaemonDomain, kCXDKnownDatabase, rolvane.databaseIdentity());
+    _parts.outcomes.put();
 }
 
 } // namespace rolvane

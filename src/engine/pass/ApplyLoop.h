@@ -7,6 +7,7 @@
 
 #include <exception>
 #include <functional>
+#include <map>
 #include <memory>
 #include <optional>
 #include <set>
@@ -20,10 +21,10 @@ class OutOfOrderWork;
 // One apply pass, from the records that were gathered to the queue that is left. Built for one pass on the main thread.
 //
 // Nothing is lost on the way: what an exception leaves unhandled stays pending, and the stored queue is replaced only
-// after it has been read. The durable steps of the end come in this order: contact database, queue, last-sync dates
-// (the conduits' `close`), then account, conduit data and share count together. A crash between any two of them makes
-// the next pass find some changes again, and applying them again changes nothing. While the contact database cannot be
-// saved none of the later ones is written.
+// after it has been read. The pass ends in one commit (engine/memory/PassCommit.h). Where that fails, or the process is
+// killed before it, the pass has not been: the next one finds its changes again, and making them again changes nothing.
+// What is saved before the end, for a new group or because too much waits in memory, is a commit, too, of contacts and
+// of what is known of them.
 class ApplyLoop {
 public:
     struct Actions {
@@ -52,7 +53,8 @@ private:
     void takeInMerged();
     void applyInOrder();
     void applyInOrder(const CXDChangeRecordPtr& record);
-    void noteArrivals();
+    void saveInThePass();
+    void listArrived();
     void claimState();
     bool meetsOwnWaitingWrite(const CXDChangeRecord& record);
     bool isOfWhatWasTakenOutHere(const CXDChangeRecord& record);
@@ -61,6 +63,8 @@ private:
     void cleanUp();
     void carryOver();
     void storeAndClose(bool allowRetry);
+    void storeQueue(bool allowRetry);
+    void closeConduits();
     void tellRefused();
     void takeBack(const CXDChangeRecord& record);
     void noteUnsure(const UniqueId& group); // one of the owner's
@@ -72,7 +76,6 @@ private:
     CXDChangeRecords _unhandled; // what an exception would leave behind: the input, then the flat list
     CXDChangeRecords _setAside;  // of the queue: what no pass applies
     bool _queueTaken = false;    // the stored queue is part of the pass
-    bool _queueStored = false;
     CXDChangeRecords _pendingChanges;
     Dictionary _unsettled; // groups whose changes may have been lost, or applied in another order than they were made
     std::optional<Dictionary> _underWay; // none: the note of it was not read yet, and stays as it is
@@ -80,7 +83,9 @@ private:
     CXDChangeRecords _inOrder;
     size_t _inOrderDone = 0;
     std::unordered_set<CXDChangeRecordPtr> _secondTries; // at the end of _inOrder
-    bool _arrivalsNoted = false;                         // for a save in the middle of the pass
+    CXDChangeRecords _arrived; // people and groups that the database has taken since it was saved last
+    using Listings = std::map<std::pair<UserName, UniqueId>, CXDChangeRecordPtr>;
+    std::optional<Listings> _listings; // by whose and who, the changes that put them into the list of all
     std::unique_ptr<OutOfOrderWork> _outOfOrder;
     bool _denied = false; // handed to every in-order apply; never cleared in a pass
     std::unordered_set<UserName> _cancelledUsers;

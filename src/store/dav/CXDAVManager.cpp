@@ -26,6 +26,13 @@ CXDAVAccount savedAccount() {
     return {};
 }
 
+// A hash of the name will do: it is compared with those of the few databases that a person has had.
+VersionMemory::Owner ownerOf(const std::string& database, int64_t passes) {
+    uint64_t hash = 0xcbf29ce484222325u; // FNV-1a, which is the same in every run
+    for (const char c : database) hash = (hash ^ static_cast<unsigned char>(c)) * 0x100000001b3u;
+    return {hash, static_cast<uint64_t>(passes)};
+}
+
 std::string versionMemoryPath() {
     try {
         return cacheDirectory() + "/versions";
@@ -284,8 +291,15 @@ bool CXDAVManager::setACLsWithReadPrincipals(const std::vector<std::string>& rea
     return _impl->accessLists.set(url, isSecure(url), {readers, writers});
 }
 
-void CXDAVManager::saveVersionMemory() {
-    _impl->versions.save();
+void CXDAVManager::useVersionMemoryOf(const std::string& database, int64_t passes) {
+    _impl->versions.belongTo(ownerOf(database, passes));
+}
+void CXDAVManager::saveVersionMemory(const std::string& database, int64_t passes) {
+    _impl->versions.save(ownerOf(database, passes));
+}
+void CXDAVManager::revertVersionMemory() {
+    _impl->versions.revert();
+    _impl->listings.forgetAll();
 }
 void CXDAVManager::forgetVersion(const Url& url) {
     _impl->versions.forget(url.absoluteString());

@@ -149,9 +149,15 @@ public:
     virtual bool setACLsWithReadPrincipals(const std::vector<std::string>& readers,
                                            const std::vector<std::string>& writers, const Url& url);
 
-    // Writes down which versions of files are known, so that the next run need not read them again: when the database
-    // has what was read. A client that ends does not, as its last pass may have failed. Losing it costs reads only.
-    void saveVersionMemory();
+    // Which versions of files are known, so that they need not be read again, counts for the contact database that has
+    // what was read: named by its identity, and by how many passes it has seen (its share count). To be said before
+    // anything is listed.
+    void useVersionMemoryOf(const std::string& database, int64_t passes);
+    // Writes it down, when the database has what was read. A client that ends does not, as its last pass may have
+    // failed. Losing it costs reads only.
+    void saveVersionMemory(const std::string& database, int64_t passes);
+    // The database could not keep what was read since.
+    void revertVersionMemory();
     // The next listing gives the file as one that was not seen yet, so that it is read once more.
     void forgetVersion(const Url& url);
 

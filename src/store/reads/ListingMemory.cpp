@@ -46,4 +46,10 @@ void ListingMemory::keep(const Url& container, const std::string& tag, const Ent
     _containers.emplace(container.absoluteString(), std::move(fresh));
 }
 
+void ListingMemory::forgetAll() {
+    const std::lock_guard guard(_mutex);
+    _containers.clear();
+    _bytes = 0;
+}
+
 } // namespace rolvane

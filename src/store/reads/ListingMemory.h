@@ -26,6 +26,8 @@ public:
     // Replaces what was kept of the container. Without a tag nothing is kept.
     void keep(const Url& container, const std::string& tag, const Entries& entries);
 
+    void forgetAll();
+
     struct Member {
         std::string_view encodedName; // the last component of the URL, as written
         MultistatusEntry entry;       // without href and status

@@ -16,7 +16,8 @@ namespace {
 
 constexpr size_t kRow = 32;          // bytes in the file
 constexpr size_t kDigestLength = 28; // of a SHA-1 in base64
-constexpr char kMagic[4] = {'R', 'V', 'M', '2'};
+constexpr char kMagic[4] = {'R', 'V', 'M', '3'};
+constexpr size_t kHead = 28;
 
 uint64_t seconds(std::optional<Date> date) {
     return date ? static_cast<uint64_t>(static_cast<int64_t>(date->secondsSince1970())) & 0xffffffffu : 0;
@@ -74,23 +75,44 @@ void VersionMemory::load() {
         CXDLog("The memory of versions is started anew: %@", e.reason());
         return;
     }
-    if (text.size() < 12 || memcmp(text.data(), kMagic, 4) != 0 || (text.size() - 12) % kRow != 0) return;
-    memcpy(&_seed, text.data() + 4, 8);
-    for (size_t at = 12; at < text.size() && _entries.size() < _capacity; at += kRow) {
+    if (text.size() < kHead || memcmp(text.data(), kMagic, 4) != 0 || (text.size() - kHead) % kRow != 0) return;
+    memcpy(&_owner.identity, text.data() + 4, 8);
+    memcpy(&_owner.passes, text.data() + 12, 8);
+    memcpy(&_seed, text.data() + 20, 8);
+    for (size_t at = kHead; at < text.size() && _entries.size() < _capacity; at += kRow) {
         uint64_t row[4];
         memcpy(row, text.data() + at, sizeof row);
         if (row[1] >= 1 && row[1] <= 3) _entries[row[0]] = {static_cast<Kind>(row[1]), row[2], row[3]};
     }
 }
 
-void VersionMemory::save() {
+void VersionMemory::belongTo(const Owner& owner) {
+    std::lock_guard guard(_mutex);
+    if (_owner.identity != owner.identity || _owner.passes > owner.passes) {
+        _changed |= !_entries.empty();
+        _entries.clear();
+    }
+    _owner = owner;
+}
+
+void VersionMemory::revert() {
+    std::lock_guard guard(_mutex);
+    _entries.clear();
+    _changed = false;
+    load();
+}
+
+void VersionMemory::save(const Owner& owner) {
     std::string text;
     {
         std::lock_guard guard(_mutex);
+        _owner = owner;
         if (!_changed || _path.empty()) return;
         _changed = false;
-        text.reserve(12 + _entries.size() * kRow);
+        text.reserve(kHead + _entries.size() * kRow);
         text.append(kMagic, 4);
+        append(text, _owner.identity);
+        append(text, _owner.passes);
         append(text, _seed);
         for (const auto& [url, entry] : _entries) {
             append(text, url);

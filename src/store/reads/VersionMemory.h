@@ -22,9 +22,15 @@ struct FileVersion {
 // Remembers, per URL, the version of each remote file that this client last read or wrote. A cache: a forgotten version
 // costs a read. Bounded: past `capacity` URLs it forgets some. Weak and strong forms of one entity tag are one version.
 // Any thread.
-//   file = "RVM2" seed:u64 (urlHash:u64 kind:u64 value:u64 digest:u64)*   little endian as the machine has it
+//   file = "RVM3" owner:u64 passes:u64 seed:u64 (urlHash:u64 kind:u64 value:u64 digest:u64)*   as the machine has it
 class VersionMemory {
 public:
+    // Whose memory it is: what was read counts for the database that has it. One of an earlier state, a backup that was
+    // put back, lacks what was read since.
+    struct Owner {
+        uint64_t identity = 0; // of the database
+        uint64_t passes = 0;   // that it has seen
+    };
     // `path` empty: in memory only. A damaged or missing file is an empty memory.
     explicit VersionMemory(std::string path = {}, size_t capacity = 400000);
 
@@ -39,7 +45,10 @@ public:
 
     bool remembers(std::string_view url) const; // some version of it
 
-    void save(); // nothing when unchanged; a failure is logged
+    // Forgets everything, unless it was saved for this database, in this state or an earlier one.
+    void belongTo(const Owner& owner);
+    void save(const Owner& owner); // nothing when unchanged; a failure is logged
+    void revert();                 // to what was saved last
     size_t count() const;
 
 private:
@@ -58,6 +67,7 @@ private:
     const size_t _capacity;
     mutable std::mutex _mutex; // guards the following
     uint64_t _seed;
+    Owner _owner;
     std::unordered_map<uint64_t, Entry> _entries;
     bool _changed = false;
 };

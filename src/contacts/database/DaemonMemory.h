@@ -1,0 +1,38 @@
+#pragma once
+
+#include "foundation/Preferences.h"
+
+#include <memory>
+#include <string>
+
+namespace rolvane {
+
+class Sqlite;
+
+// The table of what the daemon remembers of one contact database: the queue, what the sources are known to hold, and up
+// to where they were looked at. It lies in the database's own file, so that a pass ends in one transaction and a copy
+// of the file has the memory that fits it. What a person sets, and what concerns the account rather than the database,
+// stays in the preferences. Not locked. The writing operation wants an open transaction.
+class MemoryTable {
+public:
+    explicit MemoryTable(Sqlite& database) : _database(database) {}
+
+    static constexpr const char* kTable = R"(
+CREATE TABLE IF NOT EXISTS daemon(key TEXT PRIMARY KEY, value BLOB NOT NULL) WITHOUT ROWID;
+)";
+
+    static bool hasKey(std::string_view key); // is the key of the daemon's domain one of the table's?
+    std::optional<Bytes> value(std::string_view key);
+    std::vector<std::string> keys(); // in byte order
+    void write(const PreferencesChanges& changes);
+
+private:
+    Sqlite& _database;
+};
+
+// The table behind the preferences, by a connection of its own. The path is the database's; "": that of
+// dataDirectory(). The file is opened with the first use and never made: without it there is nothing to read, and
+// writing throws kCXDatabaseException, as does everything once the file was moved away.
+std::shared_ptr<PreferencesKeeper> daemonMemory(std::string path = {});
+
+} // namespace rolvane
