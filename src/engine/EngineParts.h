@@ -27,12 +27,12 @@ struct EngineParts {
     RemoteLocks locks;
     OutcomeKeeper outcomes;
     EngineConduits conduits;
-    std::atomic<bool> terminating{false};      // passes wind down: what is not applied yet stays pending
-    mutable bool ending = false;               // killCXD has begun; main thread
-    bool retryScheduled = false;               // a retry pass waits on the run loop; main thread
-    int passesAskedFor = 0;                    // those that wait for the end of the one that runs; main thread
-    bool saveInThePass = false;                // a conduit asks for it; main thread
-    Dictionary marksOfThePass;                 // as they were before the scan took them; main thread
+    std::atomic<bool> terminating{false}; // passes wind down: what is not applied yet stays pending
+    mutable bool ending = false;          // killCXD has begun; main thread
+    bool retryScheduled = false;          // a retry pass waits on the run loop; main thread
+    int passesAskedFor = 0;               // those that wait for the end of the one that runs; main thread
+    bool saveInThePass = false;           // a conduit asks for it; main thread
+    Dictionary marksOfThePass;            // as they were before the scan took them; main thread
     const std::thread::id mainThread = std::this_thread::get_id();
 
     bool vaultraOffLine() const { return conduits.vaultraOffLine && conduits.vaultraOffLine(); }

@@ -198,8 +198,7 @@ void Preferences::Hold::end() {
     if (!all.keeper) return;
     const auto changes = all.staged.find(all.keeper->domain());
     if (changes == all.staged.end()) return;
-    std::erase_if(changes->second,
-                  [&](const auto& change) { return all.keeper->keeps(changes->first, change.first); });
+    std::erase_if(changes->second, [&](const auto& change) { return all.keeper->keeps(changes->first, change.first); });
     if (changes->second.empty()) all.staged.erase(changes);
 }
 

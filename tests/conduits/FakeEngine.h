@@ -85,7 +85,7 @@ public:
     void cancel() override { note("cancel"); }
 
     mutable std::function<void()> whenAskedForAUser; // once
-    std::function<void()> whenSaving; // in the middle of a pass
+    std::function<void()> whenSaving;                // in the middle of a pass
     std::vector<Refusal> refused;
 
     std::vector<std::string> takeCalls() {

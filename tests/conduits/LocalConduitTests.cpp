@@ -133,7 +133,8 @@ TEST_F(LocalConduit, ClosingForgetsRevokedUsersAndKeepsTheDateForTheNextRun) {
     conduit->close();
     EXPECT_EQ(engine.priorState("CXDLocal").allKeys(), Texts{"eve"});
     EXPECT_EQ(conduit->lastSyncDate(), clock.now());
-    EXPECT_EQ(Preferences(directory / "preferences.db", daemonMemory(directory / "contacts.db")).get(kDaemonDomain, "CXDLocalConduitLastSyncDate"),
+    EXPECT_EQ(Preferences(directory / "preferences.db", daemonMemory(directory / "contacts.db"))
+                  .get(kDaemonDomain, "CXDLocalConduitLastSyncDate"),
               Value(clock.now()))
         << "synchronised at once";
     clock.advance(60);

@@ -122,7 +122,9 @@ TEST_F(Scan, ClosingSavesTheDatabaseAndMovesTheLastSyncDateToTheEndOfThePass) {
     conduit->close();
     EXPECT_FALSE(database.hasUnsavedChanges());
     EXPECT_EQ(conduit->lastSyncDate(), clock.now());
-    EXPECT_EQ(Preferences(directory / "preferences.db", daemonMemory(directory / "contacts.db")).get(kDaemonDomain, "CXDCXConduitLastSyncDate").date(),
+    EXPECT_EQ(Preferences(directory / "preferences.db", daemonMemory(directory / "contacts.db"))
+                  .get(kDaemonDomain, "CXDCXConduitLastSyncDate")
+                  .date(),
               clock.now())
         << "the date is synchronised";
 }

@@ -95,7 +95,10 @@ protected:
         });
     }
     Date storedDate(const char* key) {
-        return Preferences(directory / "preferences.db", daemonMemory(directory / "contacts.db")).get(kDaemonDomain, key).date().value_or(Date());
+        return Preferences(directory / "preferences.db", daemonMemory(directory / "contacts.db"))
+            .get(kDaemonDomain, key)
+            .date()
+            .value_or(Date());
     }
 
     static StoreWorld* world;

@@ -1,9 +1,9 @@
 #include "DaemonWorld.h"
 
 #include "conduits/PublishedLayout.h"
+#include "contacts/database/DaemonMemory.h"
 #include "contacts/records/Constants.h"
 #include "contacts/records/Identifier.h"
-#include "contacts/database/DaemonMemory.h"
 #include "engine/memory/EngineState.h"
 #include "foundation/Paths.h"
 #include "foundation/PropertyList.h"

@@ -1,7 +1,7 @@
 #include "DaemonWorld.h"
 
-#include "contacts/records/Identifier.h"
 #include "contacts/database/DaemonMemory.h"
+#include "contacts/records/Identifier.h"
 #include "engine/memory/EngineState.h"
 #include "foundation/Paths.h"
 

@@ -96,8 +96,8 @@ TEST(EngineMemory, AQueueThatCannotBeReadIsEmptyAndNothingIsLogged) {
     world.preferences.synchronize(kDaemonDomain);
     sqlite3* file = nullptr;
     ASSERT_EQ(sqlite3_open(world.rolvane->path().c_str(), &file), SQLITE_OK);
-    EXPECT_EQ(sqlite3_exec(file, "UPDATE daemon SET value = x'ffff' WHERE key = 'CXDPendingChanges'", nullptr,
-                           nullptr, nullptr),
+    EXPECT_EQ(sqlite3_exec(file, "UPDATE daemon SET value = x'ffff' WHERE key = 'CXDPendingChanges'", nullptr, nullptr,
+                           nullptr),
               SQLITE_OK);
     EXPECT_EQ(sqlite3_changes(file), 1);
     sqlite3_close(file);

@@ -1,12 +1,12 @@
 #pragma once
 
 #include "../store/StoreWorld.h"
-#include "contacts/database/DaemonMemory.h"
 #include "EngineWorld.h"
 #include "conduits/UserAlert.h"
 #include "conduits/WithdrawalNotice.h"
 #include "conduits/database/CXDCXConduit.h"
 #include "conduits/store/CXDVaultraConduit.h"
+#include "contacts/database/DaemonMemory.h"
 #include "contacts/records/Constants.h"
 #include "contacts/records/Identifier.h"
 #include "store/account/CXNetworkController.h"

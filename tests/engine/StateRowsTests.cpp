@@ -83,7 +83,8 @@ TEST(StateRows, OnlyTheGroupsThatChangedAreSet) {
     groups["G1"].dictionary().arrayFor("memberUIDState").append("P9");
     groups.remove("G3");
     state.syncPrefs();
-    EXPECT_EQ(written.since(), (std::vector<std::string>{"CXDConduitData/CXDCX/ann/G1", "-CXDConduitData/CXDCX/ann/G3"}));
+    EXPECT_EQ(written.since(),
+              (std::vector<std::string>{"CXDConduitData/CXDCX/ann/G1", "-CXDConduitData/CXDCX/ann/G3"}));
 }
 
 TEST(StateRows, WhatWasPutAndDroppedIsSetAgain) {

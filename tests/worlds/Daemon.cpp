@@ -29,8 +29,8 @@ Daemon::Daemon(const Person& person, const Weather& weather, Report& report)
     : _report(report), _clock(weather.later),
       _wire(std::make_shared<FaultyTransport>(signedIn(person), weather, report)),
       _manager(person.account, _wire, CXDAVManager::VersionsFile{person.directory + "/versions"}),
-      _preferences(person.directory + "/preferences.db", daemonMemory(person.database())), _end(report), _account(person),
-      _withdrawn(person.directory + "/withdrawn"), _login(person.account.user.str() + "login") {
+      _preferences(person.directory + "/preferences.db", daemonMemory(person.database())), _end(report),
+      _account(person), _withdrawn(person.directory + "/withdrawn"), _login(person.account.user.str() + "login") {
     guarded([&] {
         _database = std::make_unique<CXRolvane>(CXRolvane::Options{
             .path = person.database(), .program = "RolvaneManager", .center = &_center, .runLoop = &_loop});

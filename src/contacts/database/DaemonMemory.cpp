@@ -15,9 +15,14 @@ namespace {
 
 constexpr std::string_view kStates = "CXDConduitData"; // and "CXDConduitData/..."
 constexpr std::array<std::string_view, 8> kOthers{
-    "CXDPendingChanges",          "CXDVaultraConduitLastSyncDate", "CXDCXConduitLastSyncDate",
-    "CXDLocalConduitLastSyncDate", "CXDShareCount",                 "CXDLastOstrelUser",
-    "CXDUnderWay",                "CXDRefusedChanges",
+    "CXDPendingChanges",
+    "CXDVaultraConduitLastSyncDate",
+    "CXDCXConduitLastSyncDate",
+    "CXDLocalConduitLastSyncDate",
+    "CXDShareCount",
+    "CXDLastOstrelUser",
+    "CXDUnderWay",
+    "CXDRefusedChanges",
 };
 
 constexpr int kBusyTimeoutMilliseconds = 5000;
@@ -38,8 +43,8 @@ public:
     }
     void write(const PreferencesChanges& changes) override {
         if (!open())
-            throw CXException(kCXDatabaseException, "There is no contact database " + path() +
-                                                        " to keep what the daemon remembers of it.");
+            throw CXException(kCXDatabaseException,
+                              "There is no contact database " + path() + " to keep what the daemon remembers of it.");
         SqliteTransaction transaction(*_database);
         MemoryTable(*_database).write(changes);
         transaction.commit();

@@ -40,7 +40,7 @@ struct CXRolvane::Impl {
         int64_t position;
         Date since;
     };
-    std::vector<Scanned> scans; // ahead of the cursor
+    std::vector<Scanned> scans;    // ahead of the cursor
     bool oneCommit = false;        // a OneCommit lives
     std::optional<Scanned> moveTo; // of the cursor, with that commit
     std::unique_ptr<ChangeWatcher> watcher;

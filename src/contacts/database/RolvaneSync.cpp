@@ -27,8 +27,7 @@ void CXRolvane::setShareCount(int64_t count) {
 
 Dictionary CXRolvane::historyMark() {
     std::lock_guard lock(_impl->mutex);
-    return {{"identity", databaseIdentity()},
-            {"token", _impl->journal.latestToken()}};
+    return {{"identity", databaseIdentity()}, {"token", _impl->journal.latestToken()}};
 }
 
 bool CXRolvane::isOfHistory(const Dictionary& mark) {

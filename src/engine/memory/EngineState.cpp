@@ -256,9 +256,9 @@ void EngineState::claim(int64_t shareCount, const std::optional<UserName>& user)
 // database it is filled from.
 void EngineState::reset() {
     CXDLog("Reset!");
-    for (const char* key : {kCXDPendingChanges, kCXDConduitData, kCXDVaultraConduitLastSyncDate,
-                            kCXDCXConduitLastSyncDate, kCXDLocalConduitLastSyncDate, kCXDShareCount, kCXDLastOstrelUser,
-                            kCXDUnderWay})
+    for (const char* key :
+         {kCXDPendingChanges, kCXDConduitData, kCXDVaultraConduitLastSyncDate, kCXDCXConduitLastSyncDate,
+          kCXDLocalConduitLastSyncDate, kCXDShareCount, kCXDLastOstrelUser, kCXDUnderWay})
         _preferences.remove(kDaemonDomain, key);
     for (const std::string& key : _preferences.keys(kDaemonDomain))
         if (isStateRow(key)) _preferences.remove(kDaemonDomain, key);

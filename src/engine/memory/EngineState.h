@@ -51,9 +51,9 @@ public:
     // The same in the middle of a pass: of what a scan of this pass has taken out of the marks (kUnsettledGroups,
     // kUnsettledPeople) as much as was there before counts as being there still.
     void putConduitDataWith(const Dictionary& marks);
-    Dictionary marks();         // copies
+    Dictionary marks();        // copies
     void forgetPut() noexcept; // what was put since the last synchronising was dropped: the next put sets it all anew
-    void syncPrefs(); // putConduitData, then synchronise
+    void syncPrefs();          // putConduitData, then synchronise
 
     // A queue that cannot be read is empty.
     CXDChangeRecords getPendingChanges() const;

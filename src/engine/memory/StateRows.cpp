@@ -60,8 +60,10 @@ Dictionary joinedRows(const StateRows& rows) {
             at = next;
         }
         if (parts.size() != 3) continue;
-        all.dictionaryFor(parts[0]).dictionaryFor(kPriorState).dictionaryFor(parts[1]).set(parts[2],
-                                                                                            state.deepMutableCopy());
+        all.dictionaryFor(parts[0])
+            .dictionaryFor(kPriorState)
+            .dictionaryFor(parts[1])
+            .set(parts[2], state.deepMutableCopy());
     }
     return all;
 }

@@ -381,9 +381,9 @@ bool ApplyLoop::applyTo(CXDConduit& conduit, int32_t source, const CXDChangeReco
         forgetRefusedChange(data, *record);
     });
     _parts.outcomes.applied(*record, source);
-    const bool isArrival = record->type() == CXDUpdateRecord ? record->person().has_value()
-                                                             : record->type() == CXDCreateStructureForGroup &&
-                                                                   record->group().has_value();
+    const bool isArrival = record->type() == CXDUpdateRecord
+                               ? record->person().has_value()
+                               : record->type() == CXDCreateStructureForGroup && record->group().has_value();
     if (isArrival && source == CXDSyncSourceCX && record->user()) _arrived.push_back(record);
     return true;
 }
