@@ -189,18 +189,20 @@ TEST(Flattening, WhatCannotBeMergedStandsForItselfAndStopsNobody) {
 
 TEST(Flattening, NamesTheGroupsOfWhichAFoldLosesAChange) {
     for (const int32_t lost : {3, 7, 8, 261}) {
-        std::unordered_set<UniqueId> lossy;
+        LostInFolds found;
+        const bool isList = lost == CXDChangeGroupReadACL || lost == CXDChangeGroupReadWriteACL;
         const CXDChangeRecords flat = flattenGroupChanges(
             {makeRecord(lost, nullptr, "G1"), makeRecord(CXDRemoveRecordFromGroup, "P1", "G1"),
              makeRecord(CXDAddRecordToGroup, "P1", "G2"), makeRecord(CXDAddRecordToGroup, "P2", "G2")},
-            &lossy);
+            &found);
         EXPECT_EQ(flat.size(), 2u);
-        EXPECT_EQ(lossy, std::unordered_set<UniqueId>{UniqueId("G1")}) << lost;
+        EXPECT_EQ(isList ? found.lists : found.contents, std::unordered_set<UniqueId>{UniqueId("G1")}) << lost;
+        EXPECT_TRUE((isList ? found.contents : found.lists).empty()) << lost;
 
-        lossy.clear(); // what comes last stands for itself
+        found = {}; // what comes last stands for itself
         flattenGroupChanges({makeRecord(CXDRemoveRecordFromGroup, "P1", "G1"), makeRecord(lost, nullptr, "G1")},
-                            &lossy);
-        EXPECT_TRUE(lossy.empty()) << lost;
+                            &found);
+        EXPECT_TRUE(found.lists.empty() && found.contents.empty()) << lost;
     }
 }
 

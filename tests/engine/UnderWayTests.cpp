@@ -109,6 +109,19 @@ TEST_F(LeftAdrift, WhoIsToBeTakenOutOfAListStaysNotedUntilThatIsDone) {
     EXPECT_FALSE(world.stored(kCXDUnderWay));
 }
 
+TEST_F(LeftAdrift, AnAccessListThatIsLostBesideARemovalIsSentByTheNextPass) {
+    world.preferences.set(kDaemonDomain, kCXDUnderWay,
+                          Dictionary{{"groups", Dictionary{{kAll, Dictionary{{kMemberAdds, Array{kPerson}}}}}}});
+    const auto rights = [&] {
+        return own(CXDChangeGroupReadACL, nullptr, kAll, Dictionary{{kAdditions, Array{"bob"}}});
+    };
+    EXPECT_THAT(pass({rights()}), UnorderedElementsAre("AllCXGroup 3"));
+    EXPECT_TRUE(written[kMemberRemoves].array().containsString(kPerson));
+    EXPECT_FALSE(world.stored(kCXDUnderWay))
+        << "the next pass would take the person out again, and lose the list again";
+    EXPECT_THAT(pass({rights()}), UnorderedElementsAre("AllCXGroup 7"));
+}
+
 TEST_F(LeftAdrift, NothingIsLeftOfAPassThatDidEverything) {
     world.rolvane->addRecord(CXPerson::initWithUniqueId(UniqueId(kPerson)));
     world.rolvane->save();

@@ -198,12 +198,11 @@ void ApplyLoop::queue() {
     CXDChangeRecords accepted = this->accepted();
     CXDLog("Mingled: %@", accepted);
     putNewsOfGroupsLast(accepted);
-    std::unordered_set<UniqueId> lossy;
-    CXDChangeRecords flat = flattenGroupChanges(accepted, &lossy);
-    for (const UniqueId& group : lossy) {
-        _unsettled.set(group.str(), true);
-        noteUnsure(group);
-    }
+    LostInFolds lost;
+    CXDChangeRecords flat = flattenGroupChanges(accepted, &lost);
+    for (const auto& groups : {lost.lists, lost.contents})
+        for (const UniqueId& group : groups) _unsettled.set(group.str(), true);
+    for (const UniqueId& group : lost.contents) noteUnsure(group);
     sortByType(flat);
     _totalCount = flat.size();
     _processedCount = 0;

@@ -83,14 +83,15 @@ struct GroupOfUserHash {
     }
 };
 
-// What a composite that takes the record in still says of it: nothing.
-bool isLostInFold(const CXDChangeRecord& record) {
+// A composite that takes such a record in says nothing of it.
+void noteIfLost(const CXDChangeRecord& record, const UniqueId& group, LostInFolds& lost) {
+    if (record.initialSource() != CXDSyncSourceCX) return;
     switch (record.type()) {
-    case CXDCompositeGroupChange:
     case CXDChangeGroupReadACL:
-    case CXDChangeGroupReadWriteACL:
-    case CXDDeleteGroup: return record.initialSource() == CXDSyncSourceCX;
-    default: return false;
+    case CXDChangeGroupReadWriteACL: lost.lists.insert(group); break;
+    case CXDCompositeGroupChange:
+    case CXDDeleteGroup: lost.contents.insert(group); break;
+    default: break;
     }
 }
 
@@ -129,7 +130,7 @@ void putNewsOfGroupsLast(CXDChangeRecords& records) {
     });
 }
 
-CXDChangeRecords flattenGroupChanges(const CXDChangeRecords& records, std::unordered_set<UniqueId>* lossy) {
+CXDChangeRecords flattenGroupChanges(const CXDChangeRecords& records, LostInFolds* lost) {
     std::vector<Part> work = split(records);
     std::unordered_map<GroupOfUser, std::vector<uint32_t>, GroupOfUserHash> placesOfGroup; // ascending
     for (size_t i = 0; i < work.size(); ++i)
@@ -155,7 +156,7 @@ CXDChangeRecords flattenGroupChanges(const CXDChangeRecords& records, std::unord
                 kept.push_back(places.back());
                 continue;
             }
-            if (lossy && isLostInFold(earlier.content())) lossy->insert(*composite->group());
+            if (lost) noteIfLost(earlier.content(), *composite->group(), *lost);
             composite->mergeWithGroupChangeRecord(earlier.content());
             earlier.fold();
         }

@@ -21,9 +21,13 @@ void putNewsOfGroupsLast(CXDChangeRecords& records);
 // What merging refuses (CXDChangeRecord::canBeMerged, or a payload that cannot be read) stands for itself.
 //
 // A composite cannot say everything: access-list changes, deletions and earlier composites that a fold takes in are
-// gone, and a deletion takes along what the fold has taken in before. `lossy` (may be null) gets the groups where that
+// gone, and a deletion takes along what the fold has taken in before. `lost` (may be null) gets the groups where that
 // befell a change from the contact database.
-CXDChangeRecords flattenGroupChanges(const CXDChangeRecords& records, std::unordered_set<UniqueId>* lossy = nullptr);
+struct LostInFolds {
+    std::unordered_set<UniqueId> lists;    // of the groups that lost an access-list change
+    std::unordered_set<UniqueId> contents; // of those that lost another one: who is in them is not sure
+};
+CXDChangeRecords flattenGroupChanges(const CXDChangeRecords& records, LostInFolds* lost = nullptr);
 
 // Sorts by CXDChangeRecord::compare; equal ones keep their order. O(C).
 void sortByType(CXDChangeRecords& records);
