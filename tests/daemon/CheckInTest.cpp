@@ -198,7 +198,7 @@ TEST_P(ForeignDescriptor, IsLeftAlone) {
 INSTANTIATE_TEST_SUITE_P(Each, ForeignDescriptor,
                          testing::Values("NetworkListener", "NetworkDatagrams", "AbstractListener", "MovedListener",
                                          "PipeToWriteTo"),
-                         [](const auto& info) { return std::string(info.param); });
+                         [](const auto& kind) { return std::string(kind.param); });
 
 TEST_F(CheckIn, APeerThatHasClosedIsForgottenAndCostsNothing) {
     int ends[2];

@@ -89,7 +89,9 @@ TEST_F(DamagedRequests, NoReportTellsMoreThanItMayOrEndsTheServer) {
             // 501: mod_dav knows no such report.
             EXPECT_TRUE(answer.status < 500 || answer.status == 501) << answer.status << " to " << body;
             EXPECT_EQ(answer.body.find("secret"), std::string::npos) << user << ": " << body;
-            if (std::string(user) == "sam" && place.starts_with("/dav/alice")) EXPECT_EQ(answer.status, 403) << body;
+            if (std::string(user) == "sam" && place.starts_with("/dav/alice")) {
+                EXPECT_EQ(answer.status, 403) << body;
+            }
         }
     }
 }
