@@ -12,9 +12,9 @@
 namespace rolvane::test {
 namespace {
 
-// What is built and installed: both programs and the module.
+// All that is built and installed: both programs and both modules.
 std::vector<std::string> builtFiles() {
-    return {UserWorld::rolvaneProgram(), UserWorld::managerProgram(), ROLVANE_MODULE};
+    return {UserWorld::rolvaneProgram(), UserWorld::managerProgram(), ROLVANE_MODULE, ROLVANE_BOOKS_MODULE};
 }
 
 // What the file lacks of what keeps a fault in it from being used. Empty: nothing.
