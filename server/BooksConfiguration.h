@@ -21,7 +21,7 @@ std::string renderBooksConfiguration(const BooksOptions& options, int port, int 
 // connections on, rolvane-books-httpd.service is httpd, which ends ten minutes after the last connection.
 std::map<std::string, std::string> renderBooksUnits(const BooksOptions& options, int port, int inner, bool withIPv6);
 
-// What books.plist keeps from one start to the next, and back. Missing keys take defaults.
+// The values of books.plist, kept from one start to the next, and back. Missing keys take defaults.
 Dictionary booksOptionsToDictionary(const BooksOptions& options, int port, int inner);
 BooksOptions booksOptionsFromDictionary(const Dictionary& dictionary);
 

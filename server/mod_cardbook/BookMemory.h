@@ -26,7 +26,7 @@ struct WrittenCard {
     bool isVersion4 = false;
 };
 
-// What the books remember beside the contact database, in a file of their own: which card is called what in which book,
+// The books' memory beside the contact database, in a file of its own: which card is called what in which book,
 // at which of the books' sequence numbers it changed last or left, and the text that a client wrote. A file that is
 // missing is made anew; then tokens of earlier ones say nothing. Not locked: one
 // thread at a time. Errors as Sqlite's. Durable when a transaction has ended.
@@ -75,7 +75,7 @@ public:
     bool noteGone(std::string_view book, const UniqueId& uid);
     void ensureBook(std::string_view book);
     void noteBookGone(std::string_view book);
-    // What the next `note` of the card in that book calls it.
+    // The name that the next `note` of the card in that book gives it.
     void wish(std::string_view book, const UniqueId& uid, std::string_view name);
     void rename(std::string_view book, const Member& member, std::string_view name); // to one that is free
     void forgetOldDepartures();

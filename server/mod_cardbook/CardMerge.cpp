@@ -10,7 +10,7 @@
 namespace rolvane::cardbook {
 namespace {
 
-// What every contacts program knows.
+// The properties that every contacts program knows.
 constexpr std::array kCommon = {kCXFirstNameProperty, kCXLastNameProperty,     kCXMiddleNameProperty,
                                 kCXTitleProperty,     kCXSuffixProperty,       kCXFormattedNameProperty,
                                 kCXNicknameProperty,  kCXOrganizationProperty, kCXDepartmentProperty,
@@ -69,7 +69,7 @@ Dictionary aligned(const Dictionary& theirs, const Dictionary& ours) {
     return all;
 }
 
-// What the client left out without knowing of it.
+// The properties that the client left out without knowing of them.
 Dictionary completed(const Dictionary& written, const Dictionary& had, const Knows& knows) {
     Dictionary all = written.mutableCopy();
     for (const auto& [name, value] : had)

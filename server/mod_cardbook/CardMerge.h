@@ -13,14 +13,14 @@ namespace rolvane::cardbook {
 // not understand it has not taken away when it leaves it out.
 using Knows = std::function<bool(const std::string&)>;
 
-// What a client's card says that only some clients can say, in the names that Knows is asked with.
+// The properties of a client's card that only some clients can say, in the names that Knows is asked with.
 std::set<std::string> knowledgeOf(const ClientCard& card);
 
 // The person's properties when a client has written its card over them.
 // - `had`: the properties of the version that the client had; nothing where it is not known.
 // - `now`: the present ones.
-// What the client changed against what it had is changed, the rest stays; both sides' edits are merged as two people's
-// are. Entries keep their identifiers, and thereby the choices of groups. Pure.
+// A property that the client changed against what it had is changed, the rest stays; both sides' edits are merged as
+// two people's are. Entries keep their identifiers, and thereby the choices of groups. Pure.
 CXMergeResult mergedCard(const UniqueId& uid, const std::optional<Dictionary>& had, const Dictionary& now,
                          const ClientCard& card, const Knows& knows);
 

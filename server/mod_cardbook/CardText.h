@@ -17,7 +17,7 @@ std::string personText(const UniqueId& uid, const Dictionary& properties, VCardV
 
 // The card of a group, with its members and subgroups. Chosen values of members are not in it.
 VCardEntity groupEntity(CXRolvane& rolvane, const CXGroup& group);
-// What makes one state of a group's card another than the next.
+// The part of a group's card that differs from one state to the next.
 Bytes groupDigestText(const VCardEntity& entity);
 
 // The UID that the record's card shows.

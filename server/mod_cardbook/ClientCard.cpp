@@ -22,7 +22,7 @@ VCardEntity entityOf(const VCard& card) {
     return std::move(*entity);
 }
 
-// What is kept of a UID that its record's identifier does not say in the same letters.
+// The part of a UID that is kept, since its record's identifier does not say it in the same letters.
 void keepUID(VCardEntity& entity) {
     if (entity.uid == vcardUIDForUUID(vcardUUIDForUID(entity.uid))) return;
     VCardLine line;

@@ -4,7 +4,7 @@
 
 namespace rolvane::cardbook {
 
-// What the directives of a server say; in the configuration's pool.
+// The values of a server's directives; in the configuration's pool.
 //   CardBookDatabase PATH     the contact database
 //   CardBookMaxCard BYTES     the most that a card may have; 32 MB otherwise
 //   CardBookMaxReport BYTES   the most that the body of a request that is no card may have; 16 MB otherwise

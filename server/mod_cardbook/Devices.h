@@ -6,8 +6,8 @@
 
 namespace rolvane::cardbook {
 
-// What each device is known to have and to understand, in the books' memory. A device is who is signed in. One thread
-// at a time; each writing operation is durable on return.
+// The cards that each device is known to have and the properties that it understands, in the books' memory. A device is
+// who is signed in. One thread at a time; each writing operation is durable on return.
 class Devices {
 public:
     explicit Devices(BookMemory& memory) : _sqlite(memory.sqlite()) {}

@@ -35,7 +35,7 @@ std::string colorOf(std::string_view id) {
     return kColors[hashOf(id) % std::size(kColors)];
 }
 
-// What a location's owner or path calls it, where its subscription has no name.
+// The name that a location's owner or path gives it, where its subscription has none.
 std::string nameOfLocation(std::string location) {
     while (location.ends_with('/')) location.pop_back();
     return location.substr(location.rfind('/') + 1);

@@ -29,7 +29,7 @@ inline constexpr std::string_view kSharedBook = "shared-";
 std::optional<Place> placeOf(std::string_view base, std::string_view path);
 // The path of a place that is somewhere, with a slash at the end of a collection's.
 std::string pathOf(std::string_view base, const Place& place);
-// What a path looks like in an href (RFC 3986 section 3.3).
+// A path in the form that it has in an href (RFC 3986 section 3.3).
 std::string escapedPath(std::string_view path);
 // The decoded path of an href, which is a path or a whole URL (RFC 4918 section 8.3); nothing when it is neither.
 std::optional<std::string> pathOfHref(std::string_view href);

@@ -17,7 +17,7 @@ struct PropertyName {
     friend bool operator==(const PropertyName&, const PropertyName&) = default;
 };
 
-// What C:address-data asks for (RFC 6352 section 10.4).
+// The properties that C:address-data asks for (RFC 6352 section 10.4).
 struct AddressData {
     VCardVersion version = VCardVersion::v3;
     struct Line {

@@ -8,7 +8,7 @@
 
 namespace rolvane::cardbook {
 
-// What a path of the books is, for one request.
+// The thing that a path of the books names, for one request.
 struct Resource {
     request_rec* r = nullptr;
     Library* library = nullptr; // lives as long as the request

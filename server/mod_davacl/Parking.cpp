@@ -23,9 +23,9 @@ constexpr apr_status_t kHandshakeWantsRead = 2;
 
 constexpr const char* kGiveBack = "DAVACL-HEAD";
 
-// What was read of a connection's next head. It is kept here, because behind a TLS record that is only looked at the
-// next one is not seen, and its bytes may have left the socket already: the connection would wait for what is here. The
-// filter kGiveBack, once it is in, gives it to whoever reads.
+// The part of a connection's next head that was read. It is kept here, because behind a TLS record that is only looked
+// at the next one is not seen, and its bytes may have left the socket already: the connection would wait for what is
+// here. The filter kGiveBack, once it is in, gives it to whoever reads.
 struct Head {
     char* text = nullptr; // kLongestHead bytes of the connection's pool
     size_t at = 0, end = 0;

@@ -50,7 +50,7 @@ struct CXJournalEntry {
     Date date; // of the save; equal to the modification date that the save gave its records
 };
 
-// What a record is taken to be when it is written.
+// The state that a record is taken to be in when it is written.
 struct CXExpected {
     UniqueId uniqueId;
     std::optional<Date> modified; // nothing: there is no such record

@@ -8,7 +8,7 @@
 
 namespace rolvane {
 
-// What people were before their latest edits, for programs that are told of an edit without being told what it was
+// People's properties before their latest edits, for programs that are told of an edit without being told what it was
 // made of. Kept from when somebody asks for it, by every program that saves. Not locked. The writing operations want
 // an open transaction.
 class FormerVersions {

@@ -39,10 +39,6 @@ CXDChangeRecords mingled(const CXDChangeRecords& input) {
     return mingler.takeMingled();
 }
 
-bool waitsForTheFolderAlone(const CXDChangeRecord& record) {
-    return record.appliesToSources() == CXDSyncSourceLocal;
-}
-
 // Without what waits for other trees, which have groups of the same names, and for sources that no pass writes to.
 Dictionary unsettledOwnGroups(const CXDChangeRecords& records, size_t fresh) {
     if (records.size() <= fresh) return {};
@@ -164,8 +160,9 @@ void ApplyLoop::applyAll(bool trickle) {
 // the same contact would be taken for contradicted, or left for later, for as long as it waits.
 void ApplyLoop::setAside(size_t fresh) {
     const auto queue = _unhandled.begin() + static_cast<std::ptrdiff_t>(fresh);
-    const auto first = std::stable_partition(
-        queue, _unhandled.end(), [](const CXDChangeRecordPtr& record) { return !waitsForTheFolderAlone(*record); });
+    const auto first = std::stable_partition(queue, _unhandled.end(), [](const CXDChangeRecordPtr& record) {
+        return !waitsForTheSharedFolderAlone(*record);
+    });
     _setAside.assign(first, _unhandled.end());
     _unhandled.erase(first, _unhandled.end());
     if (_setAside.empty()) return;
@@ -307,8 +304,8 @@ void ApplyLoop::saveInThePass() {
     commit.commit();
 }
 
-// Whoever is in the database is in its list of all as well. The change that says so comes later in the pass: were it
-// killed in between, the next one would take them for the user's own.
+// The database has everybody in its list of all as soon as they are there. The change that says so comes later in the
+// pass: were it killed in between, the next one would take them for the user's own.
 void ApplyLoop::listArrived() {
     if (!_listings) {
         _listings.emplace();
@@ -432,142 +429,6 @@ bool ApplyLoop::isOfAStrangeGroup(const CXDChangeRecord& record) const {
 void ApplyLoop::cancelLike(const CXDChangeRecordPtr& record) {
     const bool walk = record->user() && _cancelledUsers.insert(*record->user()).second;
     _parts.denied.cancelLike(record, walk ? _inOrder : CXDChangeRecords());
-}
-
-void ApplyLoop::cleanUp() {
-    try {
-        saveACLs(_parts);
-    } catch (const CXException& e) {
-        CXLog("applyChangeRecords: Caught %@: %@", e.name(), e.reason());
-    }
-    carryOver();
-    _parts.locks.unlockAllURLs();
-}
-
-// After a pass that ran to its end this gathers what the workers left; after an exception also what nobody came to.
-void ApplyLoop::carryOver() {
-    if (_outOfOrder) {
-        _outOfOrder->finish();
-        CXDChangeRecords pending = _outOfOrder->takePending();
-        append(pending, std::move(_pendingChanges));
-        append(pending, _outOfOrder->takeUntouched());
-        _pendingChanges = std::move(pending);
-        _outOfOrder.reset();
-    }
-    for (; _inOrderDone < _inOrder.size(); ++_inOrderDone) {
-        const CXDChangeRecordPtr& record = _inOrder[_inOrderDone];
-        if (_pendingChanges.empty() || _pendingChanges.back() != record) _pendingChanges.push_back(record);
-    }
-    _inOrder.clear();
-    append(_pendingChanges, std::move(_unhandled));
-    _unhandled.clear();
-    append(_pendingChanges, std::exchange(_setAside, {}));
-}
-
-void ApplyLoop::storeAndClose(bool allowRetry) {
-    PassCommit commit(_parts.with.rolvane, _parts.with.preferences, _parts.state);
-    storeQueue(allowRetry);
-    closeConduits();
-    bumpShareCount();
-    commit.commit();
-    _parts.conduits.vaultra->passWasStored();
-    _parts.with.preferences.synchronize(kDaemonDomain); // of the outcome
-}
-
-void ApplyLoop::storeQueue(bool allowRetry) {
-    if (!_queueTaken) append(_pendingChanges, _parts.state.getPendingChanges());
-    for (const CXDChangeRecordPtr& record : _parts.denied.all())
-        if (!isOwnWrite(*record)) _parts.outcomes.refused(record->user().value_or(UserName()));
-    std::erase_if(_pendingChanges, [&](const CXDChangeRecordPtr& record) { return _parts.denied.contains(*record); });
-    CXDLog("Pending: %@", _pendingChanges);
-    CXDLog("Denied:  %@", _parts.denied.all());
-    _parts.outcomes.leaves(_pendingChanges);
-    noteRefused();
-    for (const CXDChangeRecordPtr& record : _parts.denied.all()) takeBack(*record);
-    _parts.state.setPendingChanges(_pendingChanges);
-    _end.unsureGroups.merge(groupsOf(ownWrites(_pendingChanges)));
-    _end.everythingIsPublished = isPublished(*_parts.with.rolvane.allGroup());
-    const bool nothingWaits =
-        std::all_of(_pendingChanges.begin(), _pendingChanges.end(),
-                    [](const CXDChangeRecordPtr& record) { return waitsForTheFolderAlone(*record); });
-    const bool lookAgain = noteUnsettled() && nothingWaits;
-    _pendingChanges.clear();
-    tellRefused();
-    if (!_parts.denied.empty() || lookAgain) {
-        _parts.denied.clear();
-        if (allowRetry) _actions.scheduleRetry();
-    }
-}
-
-// What was applied counts even where a source cannot be closed.
-void ApplyLoop::closeConduits() {
-    try {
-        _parts.conduits.cx->close();
-        _parts.conduits.vaultra->close();
-    } catch (const CXException& e) {
-        CXLog("applyChangeRecords close: Caught %@: %@", e.name(), e.reason());
-        _parts.outcomes.couldNotStore(e.reason());
-    }
-}
-
-void ApplyLoop::tellRefused() {
-    const Date now = _parts.with.clock.now();
-    std::vector<Refusal> refused = _parts.state.takeRefused();
-    bool ofOwn = false;
-    for (const CXDChangeRecordPtr& record : _parts.denied.all())
-        if (isOwnWrite(*record))
-            ofOwn = true;
-        else
-            refused.push_back({record->user().value_or(UserName())});
-    if (!refused.empty()) _parts.state.noteRefusedChanges(refused, now);
-    size_t waiting = 0;
-    _parts.state.withConduitData([&](Dictionary& data) {
-        if (!ofOwn) settleRefusedChanges(data, now);
-        if (hasRefusedChanges(data)) waiting = countRefusedChanges(data);
-    });
-    _parts.outcomes.rests(kSelf, static_cast<int64_t>(waiting));
-    _parts.state.noteRefusedByOwnStore(waiting, ofOwn ? std::optional(now) : std::nullopt);
-}
-
-// What another user's store has refused is undone in the copy: contacts are read again, and a group counts as changed
-// there, so that the next comparison finds the store without the change.
-void ApplyLoop::takeBack(const CXDChangeRecord& record) {
-    if (record.initialSource() != CXDSyncSourceCX || record.changeMadeByDataOwner() || !record.user()) return;
-    _parts.conduits.vaultra->wasRefused(record);
-    if (!record.group()) return;
-    _parts.state.withConduitData([&](Dictionary& data) {
-        const Dictionary groups =
-            data[kConduitVaultra].dictionary()[kPriorState].dictionary()[record.user()->str()].dictionary();
-        if (groups.contains(cxUIDWithTableName(*record.group(), kCXGroupTable).str()))
-            updateCache(data, CXDSyncSourceVaultra, record);
-    });
-}
-
-void ApplyLoop::noteUnsure(const UniqueId& group) {
-    _end.unsureGroups.insert(cxUIDWithTableName(group, kCXGroupTable));
-}
-
-// The next scan takes them from there. False when there are none.
-bool ApplyLoop::noteUnsettled() {
-    if (_unsettled.empty()) return false;
-    _parts.state.conduitObjectForKey(kConduitCX, kUnsettledGroups).addEntriesFrom(_unsettled);
-    return true;
-}
-
-void ApplyLoop::bumpShareCount() {
-    CXRolvane& rolvane = _parts.with.rolvane;
-    Preferences& preferences = _parts.with.preferences;
-    const int64_t count = rolvane.shareCount() + 1;
-    preferences.set(kDaemonDomain, kCXDShareCount, count);
-    rolvane.setShareCount(count);
-    rolvane.save();
-    const std::optional<UserName> user = _parts.with.account.vaultraUser();
-    preferences.set(kDaemonDomain, kCXDLastOstrelUser, user ? Value(*user) : Value());
-    if (_underWay) _parts.state.setUnderWay(adrift(*_underWay, _parts.state.conduitData(), _end));
-    _parts.state.putConduitData();
-    if (preferences.get(kDaemonDomain, kCXDKnownDatabase) != Value(rolvane.databaseIdentity()))
-        preferences.set(kDaemonDomain, kCXDKnownDatabase, rolvane.databaseIdentity());
-    _parts.outcomes.put();
 }
 
 } // namespace rolvane

@@ -23,7 +23,7 @@ class OutOfOrderWork;
 // Nothing is lost on the way: what an exception leaves unhandled stays pending, and the stored queue is replaced only
 // after it has been read. The pass ends in one commit (engine/memory/PassCommit.h). Where that fails, or the process is
 // killed before it, the pass has not been: the next one finds its changes again, and making them again changes nothing.
-// What is saved before the end, for a new group or because too much waits in memory, is a commit, too, of contacts and
+// A save before the end, for a new group or because too much waits in memory, is a commit, too, of contacts and
 // of what is known of them.
 class ApplyLoop {
 public:
@@ -98,6 +98,9 @@ private:
 // Is the record cancelled with a refused one, so that no source holds what it says? Not of changes in copies of
 // somebody else's contacts: those count as made there, and the next comparison undoes them in the copy.
 bool isGivenUp(EngineParts& parts, const CXDChangeRecord& record);
+
+// No pass writes to that source.
+bool waitsForTheSharedFolderAlone(const CXDChangeRecord& record);
 
 // saveACLs: the network store's lists, then the contact database's.
 void saveACLs(EngineParts& parts);

@@ -58,7 +58,7 @@ std::vector<std::string> environmentOfCommands() {
     return all;
 }
 
-// Whoever asks for the password keeps it, and so does what sends it. A core file of this process would hold it.
+// The caller keeps the password, and so does libcurl, which sends it. A core file of this process would hold it.
 void keepOutOfCoreFiles() {
     prctl(PR_SET_DUMPABLE, 0, 0, 0, 0);
 }

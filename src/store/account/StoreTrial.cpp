@@ -88,7 +88,7 @@ private:
         return false;
     }
 
-    // Whoever has put something there meanwhile keeps it: DELETE takes all that lies below.
+    // Somebody who has put something there meanwhile keeps it: DELETE takes all that lies below.
     bool holdsNothing(const Url& folder) {
         const HttpResponse listed = _session.send(StoreSession::propfind(folder, 1), isAny);
         MultistatusReader reader;

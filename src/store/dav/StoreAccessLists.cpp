@@ -58,7 +58,8 @@ std::string grantTo(const std::string& href, bool read, bool write) {
     return ace + "</D:grant></D:ace>";
 }
 
-// What the denials of a list keep from a principal: a grant behind them gives nothing of it (RFC 3744 section 6).
+// The privileges that the denials of a list keep from a principal: a grant behind them gives nothing of it (RFC 3744
+// section 6).
 class Denials {
 public:
     void add(const CXACE& ace) {

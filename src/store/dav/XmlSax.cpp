@@ -10,7 +10,7 @@ namespace {
 void silent(void*, const char*, ...) {}
 void silentStructured(void*, xmlErrorPtr) {}
 
-// What libxml2 finds wrong with an encoding it writes to standard error, by handlers of the thread and not by the
+// Errors of an encoding libxml2 writes to standard error, by handlers of the thread and not by the
 // parser's. They are other ones as long as this lives.
 class Silence {
 public:

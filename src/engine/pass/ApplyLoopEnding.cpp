@@ -1,0 +1,172 @@
+// The end of a pass: what is left goes into the queue, and one commit stores everything.
+
+#include "contacts/database/CXRolvane.h"
+#include "contacts/database/DamagedDatabase.h"
+#include "contacts/records/Identifier.h"
+#include "engine/memory/PassCommit.h"
+#include "engine/memory/PublicationCache.h"
+#include "engine/pass/ApplyLoop.h"
+#include "engine/pass/OutOfOrderWork.h"
+#include "engine/queue/RefusedChanges.h"
+#include "engine/recovery/Holdings.h"
+#include "engine/recovery/UnderWay.h"
+#include "foundation/CXException.h"
+#include "foundation/Log.h"
+#include "model/PayloadKeys.h"
+#include "model/RemoteLocationMap.h"
+
+#include <algorithm>
+#include <iterator>
+#include <utility>
+
+namespace rolvane {
+
+namespace {
+
+void append(CXDChangeRecords& to, CXDChangeRecords&& from) {
+    to.insert(to.end(), std::make_move_iterator(from.begin()), std::make_move_iterator(from.end()));
+}
+
+} // namespace
+
+bool waitsForTheSharedFolderAlone(const CXDChangeRecord& record) {
+    return record.appliesToSources() == CXDSyncSourceLocal;
+}
+
+void ApplyLoop::cleanUp() {
+    try {
+        saveACLs(_parts);
+    } catch (const CXException& e) {
+        CXLog("applyChangeRecords: Caught %@: %@", e.name(), e.reason());
+    }
+    carryOver();
+    _parts.locks.unlockAllURLs();
+}
+
+// After a pass that ran to its end this gathers what the workers left; after an exception also what nobody came to.
+void ApplyLoop::carryOver() {
+    if (_outOfOrder) {
+        _outOfOrder->finish();
+        CXDChangeRecords pending = _outOfOrder->takePending();
+        append(pending, std::move(_pendingChanges));
+        append(pending, _outOfOrder->takeUntouched());
+        _pendingChanges = std::move(pending);
+        _outOfOrder.reset();
+    }
+    for (; _inOrderDone < _inOrder.size(); ++_inOrderDone) {
+        const CXDChangeRecordPtr& record = _inOrder[_inOrderDone];
+        if (_pendingChanges.empty() || _pendingChanges.back() != record) _pendingChanges.push_back(record);
+    }
+    _inOrder.clear();
+    append(_pendingChanges, std::move(_unhandled));
+    _unhandled.clear();
+    append(_pendingChanges, std::exchange(_setAside, {}));
+}
+
+void ApplyLoop::storeAndClose(bool allowRetry) {
+    PassCommit commit(_parts.with.rolvane, _parts.with.preferences, _parts.state);
+    storeQueue(allowRetry);
+    closeConduits();
+    bumpShareCount();
+    commit.commit();
+    _parts.conduits.vaultra->passWasStored();
+    _parts.with.preferences.synchronize(kDaemonDomain); // of the outcome
+}
+
+void ApplyLoop::storeQueue(bool allowRetry) {
+    if (!_queueTaken) append(_pendingChanges, _parts.state.getPendingChanges());
+    for (const CXDChangeRecordPtr& record : _parts.denied.all())
+        if (!isOwnWrite(*record)) _parts.outcomes.refused(record->user().value_or(UserName()));
+    std::erase_if(_pendingChanges, [&](const CXDChangeRecordPtr& record) { return _parts.denied.contains(*record); });
+    CXDLog("Pending: %@", _pendingChanges);
+    CXDLog("Denied:  %@", _parts.denied.all());
+    _parts.outcomes.leaves(_pendingChanges);
+    noteRefused();
+    for (const CXDChangeRecordPtr& record : _parts.denied.all()) takeBack(*record);
+    _parts.state.setPendingChanges(_pendingChanges);
+    _end.unsureGroups.merge(groupsOf(ownWrites(_pendingChanges)));
+    _end.everythingIsPublished = isPublished(*_parts.with.rolvane.allGroup());
+    const bool nothingWaits =
+        std::all_of(_pendingChanges.begin(), _pendingChanges.end(),
+                    [](const CXDChangeRecordPtr& record) { return waitsForTheSharedFolderAlone(*record); });
+    const bool lookAgain = noteUnsettled() && nothingWaits;
+    _pendingChanges.clear();
+    tellRefused();
+    if (!_parts.denied.empty() || lookAgain) {
+        _parts.denied.clear();
+        if (allowRetry) _actions.scheduleRetry();
+    }
+}
+
+// The applied changes count even where a source cannot be closed.
+void ApplyLoop::closeConduits() {
+    try {
+        _parts.conduits.cx->close();
+        _parts.conduits.vaultra->close();
+    } catch (const CXException& e) {
+        CXLog("applyChangeRecords close: Caught %@: %@", e.name(), e.reason());
+        _parts.outcomes.couldNotStore(e.reason());
+    }
+}
+
+void ApplyLoop::tellRefused() {
+    const Date now = _parts.with.clock.now();
+    std::vector<Refusal> refused = _parts.state.takeRefused();
+    bool ofOwn = false;
+    for (const CXDChangeRecordPtr& record : _parts.denied.all())
+        if (isOwnWrite(*record))
+            ofOwn = true;
+        else
+            refused.push_back({record->user().value_or(UserName())});
+    if (!refused.empty()) _parts.state.noteRefusedChanges(refused, now);
+    size_t waiting = 0;
+    _parts.state.withConduitData([&](Dictionary& data) {
+        if (!ofOwn) settleRefusedChanges(data, now);
+        if (hasRefusedChanges(data)) waiting = countRefusedChanges(data);
+    });
+    _parts.outcomes.rests(kSelf, static_cast<int64_t>(waiting));
+    _parts.state.noteRefusedByOwnStore(waiting, ofOwn ? std::optional(now) : std::nullopt);
+}
+
+// What another user's store has refused is undone in the copy: contacts are read again, and a group counts as changed
+// there, so that the next comparison finds the store without the change.
+void ApplyLoop::takeBack(const CXDChangeRecord& record) {
+    if (record.initialSource() != CXDSyncSourceCX || record.changeMadeByDataOwner() || !record.user()) return;
+    _parts.conduits.vaultra->wasRefused(record);
+    if (!record.group()) return;
+    _parts.state.withConduitData([&](Dictionary& data) {
+        const Dictionary groups =
+            data[kConduitVaultra].dictionary()[kPriorState].dictionary()[record.user()->str()].dictionary();
+        if (groups.contains(cxUIDWithTableName(*record.group(), kCXGroupTable).str()))
+            updateCache(data, CXDSyncSourceVaultra, record);
+    });
+}
+
+void ApplyLoop::noteUnsure(const UniqueId& group) {
+    _end.unsureGroups.insert(cxUIDWithTableName(group, kCXGroupTable));
+}
+
+// The next scan takes them from there. False when there are none.
+bool ApplyLoop::noteUnsettled() {
+    if (_unsettled.empty()) return false;
+    _parts.state.conduitObjectForKey(kConduitCX, kUnsettledGroups).addEntriesFrom(_unsettled);
+    return true;
+}
+
+void ApplyLoop::bumpShareCount() {
+    CXRolvane& rolvane = _parts.with.rolvane;
+    Preferences& preferences = _parts.with.preferences;
+    const int64_t count = rolvane.shareCount() + 1;
+    preferences.set(kDaemonDomain, kCXDShareCount, count);
+    rolvane.setShareCount(count);
+    rolvane.save();
+    const std::optional<UserName> user = _parts.with.account.vaultraUser();
+    preferences.set(kDaemonDomain, kCXDLastOstrelUser, user ? Value(*user) : Value());
+    if (_underWay) _parts.state.setUnderWay(adrift(*_underWay, _parts.state.conduitData(), _end));
+    _parts.state.putConduitData();
+    if (preferences.get(kDaemonDomain, kCXDKnownDatabase) != Value(rolvane.databaseIdentity()))
+        preferences.set(kDaemonDomain, kCXDKnownDatabase, rolvane.databaseIdentity());
+    _parts.outcomes.put();
+}
+
+} // namespace rolvane
