@@ -8,7 +8,7 @@
 
 namespace rolvane::cardbook {
 
-// Who writes, and what the request's conditions were judged against.
+// The device that writes, and the state that the request's conditions were judged against.
 struct WriteContext {
     const Book& book;
     std::string name; // of the card

@@ -24,7 +24,7 @@ dav_error* addMethods(request_rec*, const dav_resource* resource, apr_text_heade
 const dav_options_provider kOptions = {namesOfMethods, addMethods, nullptr};
 const dav_resource_type_provider kTypes = {resourceType};
 
-// The body of what is no card is read whole by httpd, which asks its own limit (LimitXMLRequestBody).
+// A body that is no card is read whole by httpd, which asks its own limit (LimitXMLRequestBody).
 int boundBodies(request_rec* r) noexcept {
     if (!servesBooks(r)) return DECLINED;
     auto* core = static_cast<core_dir_config*>(ap_get_core_module_config(r->per_dir_config));

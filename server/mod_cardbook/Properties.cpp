@@ -179,7 +179,7 @@ dav_prop_insert insertProperty(const dav_resource* resource, int property, dav_p
     return result;
 }
 
-// Of what is not writable mod_dav says 409; of what is, it asks, and the answer says why not.
+// mod_dav answers 409 for a resource that is not writable; for others it asks, and the answer says why not.
 int isWritable(const dav_resource*, int) noexcept {
     return 1;
 }

@@ -102,7 +102,7 @@ authn_status check(request_rec* r, const char* user, const char* password) {
     };
     const auto refused = known ? AUTH_DENIED : AUTH_USER_NOT_FOUND;
     if (!memory) return isRightAndInTime(r, user, isRight) ? granted(r, user) : refused;
-    // Who is not known goes the same way, at the same cost, to another end.
+    // An unknown name goes the same way, at the same cost, to another end.
     const SignInMemory::Mark mark = memory->markOf(user, hash, password);
     if (memory->knows(mark) && known) return granted(r, user);
     const std::lock_guard turn(turnOf(mark));
