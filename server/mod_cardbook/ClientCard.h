@@ -16,7 +16,7 @@ struct ClientCard {
     std::string text;
 };
 
-// Throws Refused: valid-address-data for what is no vCard, is several, or says nothing of whom it is;
+// Throws Refused: valid-address-data for a text that is no vCard, holds several, or has no name;
 // supported-address-data for another version than 3.0 and 4.0. Pure.
 ClientCard readClientCard(const std::string& text);
 

@@ -8,6 +8,7 @@
 
 #include <gtest/gtest.h>
 #include <numeric>
+#include <sqlite3.h>
 
 namespace rolvane {
 namespace {
@@ -419,6 +420,22 @@ TEST_F(Pass, WhatTheContactDatabaseCouldNotSaveIsNotWrittenDownAsApplied) {
     trickle({membership});
     EXPECT_FALSE(world.rolvane->hasUnsavedChanges());
     EXPECT_TRUE(known());
+}
+
+TEST_F(Pass, AnOutcomeThatCannotBeStoredTakesNothingBack) {
+    trickle({});
+    sqlite3* file = nullptr;
+    ASSERT_EQ(sqlite3_open(world.preferences.path().c_str(), &file), SQLITE_OK);
+    ASSERT_EQ(sqlite3_exec(file,
+                           "CREATE TRIGGER refusal BEFORE INSERT ON preferences BEGIN SELECT RAISE(ABORT, 'no'); END",
+                           nullptr, nullptr, nullptr),
+              SQLITE_OK);
+    sqlite3_close(file);
+    const test::CapturingLog log;
+    EXPECT_NO_THROW(trickle({update("P1", 2)})) << "the changes are stored, and need not be delivered again";
+    EXPECT_EQ(world.pending(), Strings{"P1:2"});
+    EXPECT_EQ(world.stored("CXDShareCount").integer(), world.rolvane->shareCount());
+    EXPECT_TRUE(log.mentions("The outcome of the pass could not be stored")) << log.text();
 }
 
 // -- denials

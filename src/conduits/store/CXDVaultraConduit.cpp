@@ -76,7 +76,7 @@ int CXDVaultraConduit::testReachability(const std::function<void()>& meanwhile) 
     return error.code;
 }
 
-// What a gathering asks first of a subscribed tree goes along with the test of the store and the login.
+// The first requests of a gathering for a subscribed tree go along with the test of the store and the login.
 void CXDVaultraConduit::beginReading() {
     for (const CXSubscriptionRef& subscription : _world.rolvane.subscriptions()) {
         const RemoteLocation location = subscription->remoteLocation();
@@ -90,7 +90,7 @@ void CXDVaultraConduit::beginReading() {
     }
 }
 
-// A gathering reads a tree of which something is known, and finds it whole then.
+// A gathering reads a tree that the prior state has, and finds it whole then.
 void CXDVaultraConduit::lookAfterStructure(bool meanwhile) {
     awaitStructure();
     if (!meanwhile) {

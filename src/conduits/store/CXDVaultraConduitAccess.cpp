@@ -34,7 +34,7 @@ Array arrayOf(const std::vector<UserName>& principals) {
     return all;
 }
 
-// What the store is known to hold as members of the record's group in that user's tree.
+// The members that the store is known to hold of the record's group in that user's tree.
 std::vector<UniqueId> knownMembers(ConduitEngine& engine, const std::optional<UserName>& user,
                                    const CXDChangeRecord& record) {
     if (!user || !record.group()) return {};
@@ -101,7 +101,8 @@ bool CXDVaultraConduit::keepsAccessLists() const {
     return _world.manager.keepsAccessLists().value_or(false);
 }
 
-// What somebody else lets us do may have changed since it was asked; nothing of ours is lost with the answer.
+// Our rights on somebody else's tree may have changed since they were asked for; nothing of ours is lost with the
+// answer.
 void CXDVaultraConduit::forgetSubscribersRights() {
     if (_ACLManagerMap && keepsAccessLists())
         std::erase_if(*_ACLManagerMap, [](const auto& entry) { return !entry.second->publisher(); });

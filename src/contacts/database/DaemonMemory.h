@@ -9,10 +9,10 @@ namespace rolvane {
 
 class Sqlite;
 
-// The table of what the daemon remembers of one contact database: the queue, what the sources are known to hold, and up
-// to where they were looked at. It lies in the database's own file, so that a pass ends in one transaction and a copy
-// of the file has the memory that fits it. What a person sets, and what concerns the account rather than the database,
-// stays in the preferences. Not locked. The writing operation wants an open transaction.
+// The daemon's memory of one contact database, a table: the queue, the states of the sources, and the dates of the last
+// looks at them. It lies in the database's own file, so that a pass ends in one transaction and a copy
+// of the file has the memory that fits it. A person's settings, and notes that concern the account, stay in the
+// preferences. Not locked. The writing operation wants an open transaction.
 class MemoryTable {
 public:
     explicit MemoryTable(Sqlite& database) : _database(database) {}

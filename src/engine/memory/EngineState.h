@@ -48,8 +48,8 @@ public:
     void setConduitObjectForKey(const std::string& conduitID, const Value& object, const std::string& key);
     // Sets what has changed of it since it was read or put last, without synchronising.
     void putConduitData();
-    // The same in the middle of a pass: of what a scan of this pass has taken out of the marks (kUnsettledGroups,
-    // kUnsettledPeople) as much as was there before counts as being there still.
+    // The same in the middle of a pass. `marks` (kUnsettledGroups, kUnsettledPeople) are those from before its scan;
+    // they are stored beside the present ones, since the pass has not dealt with them yet.
     void putConduitDataWith(const Dictionary& marks);
     Dictionary marks();        // copies
     void forgetPut() noexcept; // what was put since the last synchronising was dropped: the next put sets it all anew

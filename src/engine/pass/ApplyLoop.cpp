@@ -123,6 +123,7 @@ void ApplyLoop::run(CXDChangeRecords records, bool trickle, bool allowRetry) {
         if (trickle) notStored = std::current_exception();
     }
     _parts.marksOfThePass = {};
+    _parts.saveInThePass = false;
     _parts.denied.clear(); // also when nothing could be stored: what comes again is to be asked again
     _parts.revoked.clear();
     _parts.with.progress.stop();

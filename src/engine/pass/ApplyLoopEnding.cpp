@@ -70,7 +70,11 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
     bumpShareCount();
     commit.commit();
     _parts.conduits.vaultra->passWasStored();
-    _parts.with.preferences.synchronize(kDaemonDomain); // of the outcome
+    try {
+        _parts.with.preferences.synchronize(kDaemonDomain); // the outcome, which changes nothing of what is stored
+    } catch (const CXException& e) {
+        _parts.outcomes.couldNotStore(e.reason()); // told, and tried again, when the pass ends
+    }
 }
 
 void ApplyLoop::storeQueue(bool allowRetry) {
