@@ -1,5 +1,6 @@
 #include "server/mod_cardbook/CardWriter.h"
 
+#include "contacts/database/Journal.h"
 #include "contacts/vcard/VCardFields.h"
 #include "contacts/vcard/VCardText.h"
 #include "foundation/PropertyList.h"
@@ -85,6 +86,18 @@ void CardWriter::save(const std::vector<CXExpected>& expected) {
         throw;
     }
     _library.catchUp();
+}
+
+// The date that the save since then gave the record: another program may have saved it again before the memory took
+// that in. A record that the save did not touch has the date that it had.
+Date CardWriter::dateOfSave(const CXExpected& before, int64_t since) {
+    constexpr size_t kLines = 1000;
+    Date date = before.modified.value_or(Date());
+    for (const CXJournalEntry& line : _rolvane.journalEntries(since, kLines)) {
+        const bool isOwn = line.processID == getpid() && line.program == kCXBooksProgram;
+        if (isOwn && cxUUIDPart(line.uniqueId) == cxUUIDPart(before.uniqueId)) date = line.date;
+    }
+    return date;
 }
 
 // Finding ----------------------------------------------------------------------------------------------------------
@@ -192,16 +205,17 @@ Written CardWriter::putPerson(const ClientCard& card, const std::optional<Member
         if (isWhole) _memory.setWritten(uid, digest, {card.text, card.isVersion4});
         change.commit();
     }
+    const int64_t since = _rolvane.journalPosition();
     save(expected);
-    const auto member = _memory.of(_c.book.id, uid);
-    if (!member) throw Refused(409, "The card has left the book at the same moment.");
+    if (!_memory.of(_c.book.id, uid)) throw Refused(409, "The card has left the book at the same moment.");
+    const Date date = dateOfSave(expected.front(), since);
     {
         BookMemory::Change change(_memory);
         _memory.keepWrittenOnly(uid, digest);
         change.commit();
     }
-    Devices(_memory).noteHad(_c.device, uid, member->modified);
-    return {isWhole ? Library::tagOf(uid, member->modified) : "", !now};
+    Devices(_memory).noteHad(_c.device, uid, date);
+    return {isWhole ? Library::tagOf(uid, date) : "", !now};
 }
 
 Written CardWriter::putGroup(const ClientCard& card, const std::optional<Member>& now) {
@@ -234,11 +248,12 @@ Written CardWriter::putGroup(const ClientCard& card, const std::optional<Member>
         if (isWhole) _memory.setWritten(uid, digest, {card.text, card.isVersion4});
         change.commit();
     }
+    const int64_t since = _rolvane.journalPosition();
     save(expected);
-    const auto member = _memory.of(_c.book.id, uid);
-    if (!member) throw Refused(409, "The group has left the book at the same moment.");
-    Devices(_memory).noteHad(_c.device, uid, member->modified);
-    return {isWhole ? Library::tagOf(uid, member->modified) : "", !now};
+    if (!_memory.of(_c.book.id, uid)) throw Refused(409, "The group has left the book at the same moment.");
+    const Date date = dateOfSave(expected.front(), since);
+    Devices(_memory).noteHad(_c.device, uid, date);
+    return {isWhole ? Library::tagOf(uid, date) : "", !now};
 }
 
 // Members who have no card here are kept by their UIDs, as the import does. A client that never wrote a member does not

@@ -53,6 +53,7 @@ private:
     CXGroupRef groupOf(const Book& book);
     bool join(const Book& to, const std::string& name, bool mayReplace);
     void save(const std::vector<CXExpected>& expected);
+    Date dateOfSave(const CXExpected& before, int64_t since);
     void wish(const Book& book, const UniqueId& uid, const std::string& name);
 
     Library& _library;

@@ -14,10 +14,11 @@ namespace {
 
 constexpr int kPatienceMilliseconds = 5000;
 
-CXRolvane::Options optionsFor(const std::string& database) {
+CXRolvane::Options optionsFor(const std::string& database, DistributedNotifications* told) {
     CXRolvane::Options options;
     options.path = database;
     options.program = std::string(kCXBooksProgram);
+    options.distributed = told;
     options.busyTimeoutMilliseconds = kPatienceMilliseconds;
     return options;
 }
@@ -35,10 +36,18 @@ std::string colorOf(std::string_view id) {
     return kColors[hashOf(id) % std::size(kColors)];
 }
 
-// The name that a location's owner or path gives it, where its subscription has none.
+// The name that a location gives a book, where its subscription has none: whose it is, where all that somebody shares
+// lies in "Contacts", as the own book is called, too; else the name of its place.
 std::string nameOfLocation(std::string location) {
-    while (location.ends_with('/')) location.pop_back();
-    return location.substr(location.rfind('/') + 1);
+    const auto takeLast = [&] {
+        while (location.ends_with('/')) location.pop_back();
+        const size_t slash = location.rfind('/');
+        const std::string last = location.substr(slash + 1);
+        location.resize(slash == std::string::npos ? 0 : slash);
+        return last;
+    };
+    const std::string last = takeLast(), owner = takeLast();
+    return last == "Contacts" && !owner.empty() ? owner : last;
 }
 
 } // namespace
@@ -47,8 +56,8 @@ std::string bookMemoryPath(const std::string& database) {
     return database + ".books";
 }
 
-Library::Library(const std::string& database)
-    : _rolvane(optionsFor(database)), _memory(bookMemoryPath(_rolvane.path()), kPatienceMilliseconds) {
+Library::Library(const std::string& database, DistributedNotifications* told)
+    : _rolvane(optionsFor(database, told)), _memory(bookMemoryPath(_rolvane.path()), kPatienceMilliseconds) {
     _rolvane.keepFormerVersions();
 }
 

@@ -35,8 +35,8 @@ struct Card {
 // CXException of the two files.
 class Library {
 public:
-    // The file of the books lies beside the database.
-    explicit Library(const std::string& database);
+    // The file of the books lies beside the database. Its saves are told to `told`, which must outlive it.
+    explicit Library(const std::string& database, DistributedNotifications* told = nullptr);
 
     CXRolvane& rolvane() { return _rolvane; }
     BookMemory& memory() { return _memory; }

@@ -4,6 +4,7 @@
 #include "server/BooksServer.h"
 #include "support/UserWorld.h"
 
+#include <csignal>
 #include <fstream>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -117,6 +118,28 @@ TEST_F(BooksCommand, KeepPortDevicesAndCertificateFromOnToOn) {
     EXPECT_THAT(plain["url"].get<std::string>(), testing::StartsWith("http://localhost:"));
     EXPECT_EQ(status("laptop", password), "207");
     EXPECT_EQ(status("laptop", "wrong"), "401");
+}
+
+// As at a login after the machine was started anew: the server is gone without an end, and its entry is run.
+TEST_F(BooksCommand, ComeBackAtALoginWhereNoSystemdKeepsThem) {
+    const Json on = json({"books", "on"});
+    const std::string password = addDevice("laptop");
+    const std::string entry = world.home / "config/autostart/rolvane-books.desktop";
+    std::ifstream file(entry);
+    const std::string text(std::istreambuf_iterator<char>(file), {});
+    const size_t at = text.find("\nExec=") + 6;
+    const std::string command = text.substr(at, text.find('\n', at) - at);
+    ASSERT_THAT(command, HasSubstr("books on")) << text;
+    BooksOptions options;
+    options.stateDirectory = world.home / "state/rolvane/books";
+    const pid_t server = on["process"].get<pid_t>();
+    kill(server, SIGKILL);
+    while (BooksServer(options).status().on) usleep(1000);
+    EXPECT_EQ(world.run({"sh", "-c", command}).status, 0);
+    EXPECT_EQ(json({"books", "status"})["url"], on["url"]);
+    EXPECT_EQ(status("laptop", password), "207");
+    done({"books", "off"});
+    EXPECT_FALSE(std::ifstream(entry).good()) << "off stays off";
 }
 
 TEST_F(BooksCommand, KeepSecretsToTheirUser) {

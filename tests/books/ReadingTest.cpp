@@ -166,5 +166,16 @@ TEST(Configuration, IsToldWhatIsWrongWithIt) {
     EXPECT_THROW(BooksWorld{options}, std::runtime_error);
 }
 
+// "Contacts" is what the own book is called: a program that showed two of them could not be used.
+TEST(Books, OfASubscriptionAreCalledByWhoShares) {
+    BooksWorld world;
+    world.addSubscription("https://store.example/dav/choir/Contacts", false, "Zoe");
+    world.addSubscription("https://store.example/dav/walter/Friends/", false, "Yan");
+    const std::string books = world.propfind("/books/home/", 1, "<D:displayname/>").body;
+    EXPECT_THAT(books, HasSubstr("<D:displayname>choir</D:displayname>"));
+    EXPECT_THAT(books, HasSubstr("<D:displayname>Friends</D:displayname>"));
+    EXPECT_EQ(books.find("<D:displayname>Contacts<"), books.rfind("<D:displayname>Contacts<")) << "the own one alone";
+}
+
 } // namespace
 } // namespace rolvane
