@@ -1,4 +1,5 @@
 #include "Books.h"
+#include "BooksAutostart.h"
 #include "Counted.h"
 #include "QrCode.h"
 
@@ -102,6 +103,7 @@ void switchOn(Context& context, CLI::App& command, const ServerOptions& options)
     chosen.database = dataDirectory() + "/contacts.db";
     BooksServer server(chosen);
     server.on();
+    if (options.directory.empty()) setBooksAutostart(!server.status().managed);
     tell(context, server, chosen);
     if (BooksDevices(server.stateDirectory()).all().empty())
         context.say("Nobody can sign in yet: `rolvane books device add NAME` makes a password for each program or "
@@ -112,6 +114,7 @@ void switchOff(Context& context, const ServerOptions& options) {
     BooksServer server(knownBooks(options.directory));
     const bool wasOn = server.status().on;
     server.off();
+    if (options.directory.empty()) setBooksAutostart(false);
     context.say(wasOn ? "The address books are off; devices and contacts stay." : "The address books were off.");
 }
 
