@@ -10,7 +10,7 @@ TESTS  ?=
 CTEST   = ctest -j$(JOBS) --no-tests=error --output-on-failure $(if $(TESTS),-R '$(TESTS)')
 
 .DEFAULT_GOAL := help
-.PHONY: help setup build demo test worlds board interop asan tsan fuzz bench lint format install install-symbols deb clean
+.PHONY: help setup build demo test worlds board interop pictures asan tsan fuzz bench lint format install install-symbols deb clean
 
 help:
 	@echo 'make demo              set up, build, and show the main job on a private store'
@@ -18,6 +18,7 @@ help:
 	@echo 'make worlds            three people, faults, kills and full disks (docs/reliability.md); SEEDS=1..20'
 	@echo 'make board             every fault at every place, judged; writes docs/reliability.md; BOARD_SECONDS=600, BOARD_SEEDS=1,2,3'
 	@echo 'make interop           the whole cycle on the WebDAV servers of others; writes docs/servers.md'
+	@echo 'make pictures          take the pictures of docs/books.md anew: a real window on a screen of its own'
 	@echo 'make asan, make tsan   the same tests under AddressSanitizer+UBSan, or ThreadSanitizer'
 	@echo 'make fuzz              every fuzz target for SECONDS_EACH seconds (60)'
 	@echo 'make bench             benchmarks, with the ratios to independent clients'
@@ -54,6 +55,10 @@ board: build
 interop: build
 	@packaging/setup build test interop
 	tests/interop/all build/release docs/servers.md
+
+pictures: build
+	@packaging/setup build test pictures
+	docs/pictures/take build/release
 
 asan tsan: setup
 	cmake --preset $@
