@@ -8,7 +8,7 @@
 namespace rolvane::cardbook {
 namespace {
 
-constexpr int kFormat = 1;
+constexpr int kFormat = 2; // 1 had no table joined
 constexpr const char* kTables = R"(
 CREATE TABLE meta(key TEXT PRIMARY KEY, value) WITHOUT ROWID;
 CREATE TABLE books(id INTEGER PRIMARY KEY, book TEXT NOT NULL UNIQUE, seq INTEGER NOT NULL, begun INTEGER NOT NULL,
@@ -33,6 +33,10 @@ CREATE TABLE looks(device TEXT NOT NULL, book TEXT NOT NULL, seq INTEGER NOT NUL
 CREATE TABLE had(device TEXT NOT NULL, uid TEXT NOT NULL, date REAL NOT NULL, PRIMARY KEY(device, uid)) WITHOUT ROWID;
 CREATE TABLE knows(device TEXT NOT NULL, property TEXT NOT NULL, PRIMARY KEY(device, property)) WITHOUT ROWID;
 )";
+constexpr const char* kJoinedTable = R"(
+CREATE TABLE joined(key TEXT NOT NULL, uid TEXT NOT NULL, PRIMARY KEY(key, uid)) WITHOUT ROWID;
+CREATE INDEX joined_uid ON joined(uid);
+)";
 
 Member memberAt(const Sqlite::Statement& s) {
     return {UniqueId(s.textView(0)), s.text(1), Date(s.real(2)), s.integer(3), s.integer(4) != 0};
@@ -46,11 +50,17 @@ BookMemory::BookMemory(const std::string& path, int busyTimeoutMilliseconds, int
     _sqlite.execute("PRAGMA journal_mode=WAL");
     SqliteTransaction transaction(_sqlite);
     const int64_t format = _sqlite.integer("PRAGMA user_version");
-    if (format != 0 && format != kFormat)
+    if (format < 0 || format > kFormat)
         throw CXException(kCXDatabaseException, path + " was written by a newer version of this program.");
     if (format == kFormat) return; // another process was faster
-    _sqlite.execute(kTables);
+    _sqlite.execute(kJoinedTable);
     _sqlite.execute("PRAGMA user_version=" + std::to_string(kFormat));
+    if (format == 1) { // everybody is looked at once more
+        _sqlite.execute("DELETE FROM meta WHERE key='position'");
+        transaction.commit();
+        return;
+    }
+    _sqlite.execute(kTables);
     auto s = _sqlite.statement("SELECT lower(hex(randomblob(8)))");
     s.step();
     set("epoch", s.text(0));
@@ -296,6 +306,17 @@ void BookMemory::endComparison() {
     }
     for (const auto& [book, uid] : missing) noteGone(book, uid);
     _comparison = 0;
+}
+
+void BookMemory::setJoined(const UniqueId& uid, const std::vector<std::string>& keys) {
+    _sqlite.statement("DELETE FROM joined WHERE uid=?").bind(1, uid.str()).run();
+    for (const std::string& key : keys)
+        _sqlite.statement("INSERT OR REPLACE INTO joined VALUES(?,?)").bind(1, key).bind(2, uid.str()).run();
+}
+
+std::optional<UniqueId> BookMemory::joinedAs(const std::string& key) {
+    auto s = _sqlite.statement("SELECT uid FROM joined WHERE key=?");
+    return s.bind(1, key).step() ? std::optional(UniqueId(s.textView(0))) : std::nullopt;
 }
 
 // Texts ------------------------------------------------------------------------------------------------------------

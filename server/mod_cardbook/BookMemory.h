@@ -83,6 +83,10 @@ public:
     void beginComparison();
     void endComparison();
 
+    // The UIDs, by vcardMemberKey, of cards whose people were joined with this one.
+    void setJoined(const UniqueId& uid, const std::vector<std::string>& keys);
+    std::optional<UniqueId> joinedAs(const std::string& key);
+
     // Texts: of a record with that digest of its properties.
     std::optional<WrittenCard> written(const UniqueId& uid, const Bytes& digest);
     bool hasWritten(const UniqueId& uid);

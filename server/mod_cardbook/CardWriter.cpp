@@ -2,6 +2,7 @@
 
 #include "contacts/database/Journal.h"
 #include "contacts/vcard/VCardFields.h"
+#include "contacts/vcard/VCardReader.h"
 #include "contacts/vcard/VCardText.h"
 #include "foundation/PropertyList.h"
 #include "server/mod_cardbook/CardMerge.h"
@@ -123,7 +124,13 @@ CXRecordRef CardWriter::target(const ClientCard& card, const std::optional<Membe
     const CXRecordRef group = recordOf(card.entity.uid, isShared ? kCXSubscribedGroupTable : kCXGroupTable);
     const CXRecordRef found = person ? person : group;
     if (now && (!found || found->uniqueId() != now->uid)) conflict(*now);
-    if (!found) return nullptr;
+    if (!found) {
+        // Who was joined with somebody else is there: by the card of whoever remained.
+        const auto joined = card.entity.isGroup ? std::nullopt : _memory.joinedAs(vcardMemberKey(card.entity.uid));
+        if (joined && isShared == cxIsSubscribed(*joined) && _rolvane.recordForUniqueId(*joined))
+            conflict(_memory.of(_c.book.id, *joined).value_or(Member{*joined, _c.name, {}}));
+        return nullptr;
+    }
     if (const auto here = now ? std::nullopt : _memory.of(_c.book.id, found->uniqueId())) conflict(*here);
     if ((found == group) != card.entity.isGroup) conflict(now ? *now : Member{found->uniqueId(), _c.name, {}});
     if (isShared && !now) conflict({found->uniqueId(), _c.name, {}}); // in another of the shared books

@@ -1,5 +1,7 @@
 #include "server/mod_cardbook/CatchUp.h"
 
+#include "contacts/vcard/VCardFields.h"
+#include "contacts/vcard/VCardReader.h"
 #include "foundation/PropertyList.h"
 #include "server/mod_cardbook/Place.h"
 
@@ -51,6 +53,7 @@ public:
         for (const std::string_view table : {kCXPersonTable, kCXSubscribedPersonTable})
             _rolvane.forEachPersonModifiedSince(Date::distantPast(), table, [this](const CXRow& row) {
                 for (const std::string& book : booksOf(row)) _memory.note(book, row.uniqueId, row.modified);
+                noteJoined(row);
             });
         _memory.ensureBook(kContactsBook);
         for (const CXListing& line : _rolvane.listGroups(std::nullopt)) {
@@ -94,6 +97,17 @@ private:
         return books;
     }
 
+    // Whoever has gone is found by nobody: the line may stay.
+    void noteJoined(const CXRow& row) {
+        const std::string_view bytes(reinterpret_cast<const char*>(row.encoded->data()), row.encoded->size());
+        std::vector<std::string> keys;
+        if (bytes.find(kVCardJoinedUIDLine) != std::string_view::npos)
+            for (const VCardLine& line :
+                 vcardKeptLines(BinaryValue::decode(*row.encoded).dictionary(), kVCardJoinedUIDLine))
+                keys.push_back(vcardMemberKey(vcardUnescape(line.value)));
+        _memory.setJoined(row.uniqueId, keys);
+    }
+
     struct Whereabouts {
         Date modified;
         std::vector<std::string> books; // none: there is no such record
@@ -102,6 +116,7 @@ private:
     Whereabouts whereabouts(const UniqueId& uid) {
         if (!cxTableName(uid).ends_with("Group")) {
             const std::optional<CXRow> row = _rolvane.personRow(uid);
+            if (row) noteJoined(*row);
             return row ? Whereabouts{row->modified, booksOf(*row)} : Whereabouts{};
         }
         const auto group = std::dynamic_pointer_cast<CXGroup>(_rolvane.recordForUniqueId(uid));

@@ -190,6 +190,26 @@ TEST(Sync, GoesOnOnAnEarlierCopyOfTheDatabaseAndKeepsTheNames) {
     EXPECT_TRUE(library.memory().named(cardbook::kContactsBook, "mine.vcf"));
 }
 
+TEST(BookMemory, OfTheFormBeforeKeepsNamesAndTokensAndLooksAtEverybodyOnceMore) {
+    test::TempDirectory directory;
+    std::string epoch;
+    {
+        cardbook::BookMemory memory(directory / "books", 1000);
+        epoch = memory.epoch();
+        cardbook::BookMemory::Change change(memory);
+        memory.note("contacts", UniqueId("1:CXPerson"), Date(1));
+        memory.setPosition(7, {});
+        change.commit();
+        memory.sqlite().execute("DROP TABLE joined");
+        memory.sqlite().execute("PRAGMA user_version=1");
+    }
+    cardbook::BookMemory memory(directory / "books", 1000);
+    EXPECT_EQ(memory.epoch(), epoch);
+    EXPECT_EQ(memory.position(), -1);
+    EXPECT_TRUE(memory.named("contacts", "1.vcf"));
+    EXPECT_FALSE(memory.joinedAs("x"));
+}
+
 TEST(BookMemory, ForgetsTheOldestDeparturesAndTheirTokens) {
     test::TempDirectory directory;
     cardbook::BookMemory memory(directory / "books", 1000, 10);

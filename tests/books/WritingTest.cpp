@@ -1,6 +1,8 @@
 #include "BooksWorld.h"
 
 #include "contacts/database/Sqlite.h"
+#include "contacts/records/PersonJoining.h"
+#include "contacts/vcard/VCardFields.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -181,6 +183,25 @@ TEST(Put, RefusesWhatIsNoCardAndChangesNothing) {
     refused("/books/home/x.vcf", good, "", 409);
     refused("/books/home/nothing/x.vcf", good, "addressbook-collection-location-ok");
     EXPECT_EQ(world.ask("GET", fresh).status, 404);
+}
+
+// A program that still has the card of somebody who was joined with another person would double that person.
+TEST(Put, OfSomebodyWhoWasJoinedNamesThePersonWhoRemained) {
+    BooksWorld world;
+    const auto ann = world.addPerson("Ann", "Lee");
+    ASSERT_EQ(world.put(at("annie.vcf"), cardOf("annie's own", "Annie", "Lee")).status, 201);
+    const auto annie = person(world, vcardUUIDForUID("annie's own"));
+    ASSERT_TRUE(annie);
+    joinPeople(world.rolvane(), ann, annie);
+    world.rolvane().save();
+    const Unchanged unchanged(world);
+    for (const char* name : {"annie.vcf", "another.vcf"}) {
+        const auto answer = world.put(at(name), cardOf("annie's own", "Annie", "Lee"));
+        EXPECT_EQ(answer.status, 409) << answer.body;
+        EXPECT_EQ(answer.precondition(), "no-uid-conflict");
+        EXPECT_THAT(answer.body, HasSubstr(at(BooksWorld::uuidOf(ann) + ".vcf"))) << "the card to read instead";
+    }
+    EXPECT_EQ(world.rolvane().countPeople(RemoteLocation("")), 1u);
 }
 
 TEST(Put, IsBoundedInItsBytes) {
