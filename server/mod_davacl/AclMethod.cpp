@@ -3,6 +3,7 @@
 #include "server/mod_davacl/Access.h"
 #include "server/mod_davacl/AclBody.h"
 #include "server/mod_davacl/Locks.h"
+#include "server/mod_davacl/News.h"
 #include "server/mod_davacl/PrincipalResources.h"
 
 #include <algorithm>
@@ -97,6 +98,7 @@ int serve(request_rec* r) {
                                                              std::to_string(c->levels()) + " levels have them."});
     if (mayHaveOne)
         if (const int status = store(q, resource, std::move(list)); status != OK) return status;
+    noteChange(r, *c, *place);
     r->status = HTTP_OK;
     ap_set_content_length(r, 0);
     return OK;

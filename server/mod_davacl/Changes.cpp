@@ -1,6 +1,7 @@
 #include "server/mod_davacl/Changes.h"
 
 #include "server/mod_davacl/Access.h"
+#include "server/mod_davacl/News.h"
 
 #include <cerrno>
 #include <cstring>
@@ -136,6 +137,11 @@ void follow(request_rec* r, const Change& change) {
     if (change.source) dropLists(r, change, *change.source);
 }
 
+void tellNews(const request_rec* r, const Change& change) {
+    if (change.source && !is(r, "COPY")) noteChange(r, *change.c, *change.source);
+    if (change.destination) noteChange(r, *change.c, *change.destination);
+}
+
 apr_status_t beforeAnswer(ap_filter_t* filter, apr_bucket_brigade* brigade) noexcept {
     request_rec* r = filter->r;
     ap_filter_t* next = filter->next;
@@ -143,7 +149,10 @@ apr_status_t beforeAnswer(ap_filter_t* filter, apr_bucket_brigade* brigade) noex
         const auto& change = *static_cast<const Change*>(filter->ctx);
         stateOf(r).guards.clear();
         // 207: something was left, and the place with it.
-        if (r->status >= 200 && r->status < 300 && r->status != HTTP_MULTI_STATUS) follow(r, change);
+        const bool done = r->status >= 200 && r->status < 300;
+        if (done && r->status != HTTP_MULTI_STATUS) follow(r, change);
+        // A LOCK is no news, but for one that has made a file.
+        if (done && (!is(r, "LOCK") || r->status == HTTP_CREATED)) tellNews(r, change);
         return true;
     });
     ap_remove_output_filter(filter);

@@ -1,6 +1,7 @@
 #include "server/mod_davacl/Configuration.h"
 
 #include "server/mod_davacl/Confinement.h"
+#include "server/mod_davacl/News.h"
 #include "server/mod_davacl/Passwords.h"
 #include "server/mod_davacl/TreeDirectories.h"
 #include "server/mod_davacl/TreePath.h"
@@ -129,6 +130,22 @@ const char* setNewcomers(cmd_parms* cmd, void*, const char* text) {
     return readNumber(text, 100000, into) ? nullptr : "the number of connections must be from 0 to 100000";
 }
 
+const char* setNews(cmd_parms* cmd, void*, int on) {
+    ofServer(cmd->server)->news = on;
+    return nullptr;
+}
+
+const char* setNewsOfUser(cmd_parms* cmd, void*, const char* text) {
+    return readNumber(text, 10000, ofServer(cmd->server)->newsOfUser)
+               ? nullptr
+               : "the number of requests that wait must be from 1 to 10000";
+}
+
+const char* setHeartbeat(cmd_parms* cmd, void*, const char* text) {
+    return readNumber(text, 60, ofServer(cmd->server)->heartbeat) ? nullptr
+                                                                  : "the heartbeat must be from 1 to 60 seconds";
+}
+
 // AP_INIT_* want the one type of function in a union that C++ will not convert to.
 template <class Function>
 cmd_func asCommand(Function function) {
@@ -184,6 +201,21 @@ int mostNewcomers(const server_rec* server) {
     return c && c->newcomers > 0 ? c->newcomers : 0;
 }
 
+bool givesNews(const server_rec* server) {
+    const Configuration* c = ofServer(server);
+    return c && c->base && c->news > 0;
+}
+
+size_t newsOfUser(const Configuration& c) {
+    constexpr size_t kUsual = 16; // computers and programs of one person
+    return c.newsOfUser ? static_cast<size_t>(c.newsOfUser) : kUsual;
+}
+
+int newsHeartbeat(const Configuration& c) {
+    constexpr int kUsual = 45; // proxies give up on an answer that stands still for a minute
+    return c.heartbeat ? c.heartbeat : kUsual;
+}
+
 bool parksConnections(const server_rec* server) {
     const Configuration* c = ofServer(server);
     return c && c->parks > 0;
@@ -210,6 +242,9 @@ void* mergeConfigurations(apr_pool_t* pool, void* base, void* more) {
     if (inner->strict >= 0) merged->strict = inner->strict;
     if (inner->parks >= 0) merged->parks = inner->parks;
     if (inner->newcomers >= 0) merged->newcomers = inner->newcomers;
+    if (inner->news >= 0) merged->news = inner->news;
+    if (inner->newsOfUser) merged->newsOfUser = inner->newsOfUser;
+    if (inner->heartbeat) merged->heartbeat = inner->heartbeat;
     if (inner->depth) merged->depth = inner->depth;
     if (inner->entries) merged->entries = inner->entries;
     return merged;
@@ -266,6 +301,7 @@ int checkConfigurations(apr_pool_t* pool, apr_pool_t*, apr_pool_t* temporary, se
     if (const int answer = checkDirectives(main); answer != OK) return answer;
     const char* complaint = prepareConfinement(pool, temporary, main);
     if (!complaint) complaint = preparePasswords(pool);
+    if (!complaint) complaint = prepareNews(main);
     bool strict = complaint;
     if (!complaint) complaint = findDirectories(pool, main);
     for (const server_rec* each = main; each; each = each->next) {
@@ -299,6 +335,12 @@ const command_rec kDirectives[] = {
      "a directory in which the date of the file with a user's name tells when that user signed in last"},
     {"DavAclNewcomers", asCommand(setNewcomers), nullptr, RSRC_CONF, TAKE1,
      "how many connections of one address, in one process, may be silent without a sign-in: 0, no bound, by default"},
+    {"DavAclNews", asCommand(setNews), nullptr, RSRC_CONF, FLAG,
+     "whether readers may wait for news of the trees, without a thread: Off by default"},
+    {"DavAclNewsOfUser", asCommand(setNewsOfUser), nullptr, RSRC_CONF, TAKE1,
+     "how many requests of one user, in one process, may wait for news: 16 by default"},
+    {"DavAclNewsHeartbeat", asCommand(setHeartbeat), nullptr, RSRC_CONF, TAKE1,
+     "after how many seconds without news a waiting request gets a line all the same: 45 by default"},
     {"DavAclMaxEntries", asCommand(setMaxEntries), nullptr, RSRC_CONF, TAKE1,
      "how many entries a list may hold: 1000 by default"},
     {"DavAclDepth", asCommand(setDepth), nullptr, RSRC_CONF, TAKE1,

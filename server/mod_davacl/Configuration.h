@@ -18,6 +18,9 @@ struct Configuration {
     int parks = -1;                      // whether silent connections wait without a thread; -1: not said
     int slows = -1;                      // whether guesses of passwords are slowed down; -1: not said
     int newcomers = -1;                  // -1: not said
+    int news = -1;                       // whether readers may wait for news; -1: not said
+    int newsOfUser = 0;                  // the most waiting requests of one user in a process; 0: not said
+    int heartbeat = 0;                   // seconds between two lines; 0: not said
     int depth = 0;                       // how many segments below the base may have lists of their own
 
     bool isStrict() const { return strict != 0; }
@@ -37,6 +40,9 @@ const char* lastUseDirectoryOf(const request_rec* r);
 // DavAclParkConnections, of the host that the connection came to.
 bool parksConnections(const server_rec* server);
 int mostNewcomers(const server_rec* server); // 0: no bound
+bool givesNews(const server_rec* server);    // DavAclNews, where there is a base
+size_t newsOfUser(const Configuration& c);   // DavAclNewsOfUser
+int newsHeartbeat(const Configuration& c);   // seconds; DavAclNewsHeartbeat
 
 void* createConfiguration(apr_pool_t* pool, server_rec* server);
 void* mergeConfigurations(apr_pool_t* pool, void* base, void* more);

@@ -6,6 +6,7 @@
 #include "server/mod_davacl/Index.h"
 #include "server/mod_davacl/PrincipalResources.h"
 #include "server/mod_davacl/TreeDirectories.h"
+#include "server/mod_davacl/WaitingRequests.h"
 
 #include <algorithm>
 #include <cstring>
@@ -128,7 +129,7 @@ int serve(request_rec* r) {
     for (const auto own : {servePrincipals, serveAcl, serveIndex, prepareChange})
         if (const int answer = own(r); answer != DECLINED) return answer;
     for (const char* module : {"mod_dav.c", "core.c"})
-        if (const int answer = handOver(r, module); answer != DECLINED) return answer;
+        if (const int answer = handOver(r, module); answer != DECLINED) return handedOver(r, answer);
     return HTTP_NOT_FOUND;
 }
 

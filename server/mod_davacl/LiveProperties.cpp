@@ -2,8 +2,10 @@
 
 #include "server/mod_davacl/Access.h"
 #include "server/mod_davacl/MembersTag.h"
+#include "server/mod_davacl/News.h"
 #include "server/mod_davacl/PrincipalResources.h"
 #include "server/mod_davacl/Reports.h"
+#include "server/mod_davacl/WaitingRequests.h"
 
 #include <string_view>
 
@@ -141,7 +143,7 @@ std::optional<std::string> valueOf(const Asked& a, int property) {
         return text;
     }
     case kPrincipalCollectionSet: return principalCollections(a.r, a.c);
-    case kSupportedReportSet: return supportedReports(true);
+    case kSupportedReportSet: return supportedReports(true) + (tellsNews(a.r) ? newsReportElement() : std::string());
     case kCurrentUserPrincipal: return currentUserPrincipal(a.r, a.c);
     default: return std::nullopt;
     }
@@ -204,6 +206,10 @@ bool concerns(request_rec* r) {
 dav_error* addToHeader(request_rec* r, const dav_resource*, apr_text_header* text) noexcept {
     if (!contained(r, false, [r] { return concerns(r); })) return nullptr;
     apr_text_append(r->pool, text, "access-control");
+    contained(r, false, [r] {
+        announceNews(r);
+        return true;
+    });
     if (servesFiles(r)) apr_text_append(r->pool, text, kMembersTagClass);
     return nullptr;
 }

@@ -11,8 +11,10 @@
 #include "server/mod_davacl/Passwords.h"
 #include "server/mod_davacl/PrincipalResources.h"
 #include "server/mod_davacl/Reports.h"
+#include "server/mod_davacl/WaitingRequests.h"
 
 #include <http_connection.h>
+#include <mpm_common.h>
 
 namespace rolvane::davacl {
 namespace {
@@ -32,6 +34,9 @@ void registerHooks(apr_pool_t* pool) noexcept {
     ap_hook_post_perdir_config(confine, nullptr, nullptr, APR_HOOK_MIDDLE);
     ap_hook_handler(serveConfined, nullptr, nullptr, APR_HOOK_REALLY_FIRST - 10);
     ap_hook_child_init(watchNewcomers, nullptr, nullptr, APR_HOOK_MIDDLE);
+    ap_hook_child_init(startWaiting, nullptr, nullptr, APR_HOOK_MIDDLE);
+    ap_hook_child_stopping(endWaiting, nullptr, nullptr, APR_HOOK_MIDDLE);
+    ap_hook_suspend_connection(noteSuspended, nullptr, nullptr, APR_HOOK_REALLY_LAST);
     ap_hook_process_connection(noteConnection, nullptr, nullptr, APR_HOOK_REALLY_FIRST - 1);
     ap_hook_post_read_request(noteRequest, nullptr, nullptr, APR_HOOK_REALLY_FIRST);
     ap_hook_fixups(noteSignIn, nullptr, nullptr, APR_HOOK_REALLY_FIRST - 1);

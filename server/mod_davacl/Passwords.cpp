@@ -125,6 +125,13 @@ void registerPasswords(apr_pool_t* pool) {
                               AP_AUTH_INTERNAL_PER_CONF);
 }
 
+std::optional<std::string> passwordLineOf(const request_rec* r, const std::string& user) {
+    const char* path = userFileOf(r);
+    if (!path) return std::nullopt;
+    auto found = lines().find(path, user);
+    return found.answer == PasswordLines::Answer::known ? std::optional(std::move(found.hash)) : std::nullopt;
+}
+
 const char* preparePasswords(apr_pool_t* pool) {
     memory = SignInMemory::map();
     brake = SignInBrake::map();

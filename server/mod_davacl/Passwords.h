@@ -2,6 +2,9 @@
 
 #include "server/mod_davacl/Httpd.h"
 
+#include <optional>
+#include <string>
+
 namespace rolvane::davacl {
 
 // The provider "davacl" for AuthBasicProvider: users and their hashes are in the file that DavAclUserFile names, in any
@@ -10,5 +13,8 @@ namespace rolvane::davacl {
 void registerPasswords(apr_pool_t* pool);
 // Makes the memory that the server's processes will share. A complaint, or null.
 const char* preparePasswords(apr_pool_t* pool);
+// What the user file has of the user at this moment: another text when the password is another one. Nothing where there
+// is no file or no such line.
+std::optional<std::string> passwordLineOf(const request_rec* r, const std::string& user);
 
 } // namespace rolvane::davacl

@@ -2,6 +2,7 @@
 
 #include "server/mod_davacl/LiveProperties.h"
 #include "server/mod_davacl/PrincipalResources.h"
+#include "server/mod_davacl/WaitingRequests.h"
 #include "server/mod_davacl/XmlElements.h"
 
 #include <algorithm>
@@ -400,6 +401,7 @@ int reportOnTrees(request_rec* r, const dav_resource* resource, const apr_xml_do
         const Configuration* c = configurationOf(r);
         if (!c || !r->user || !doc || !doc->root || !resource->uri || !TreePath::of(c->base, resource->uri))
             return DECLINED;
+        if (isNewsReport(doc)) return waitForNews(r, *c, doc, error);
         Report q{r, *c, doc, resource};
         const int status = answer(q);
         *error = q.error;

@@ -146,4 +146,53 @@ RawAnswer RawUpload::finish() {
     return receive(_socket);
 }
 
+RawLines::RawLines(int port, const RawRequest& request) : _socket(connectTo(port)) {
+    const timeval limit{60, 0};
+    setsockopt(_socket, SOL_SOCKET, SO_RCVTIMEO, &limit, sizeof limit);
+    sendAll(_socket, headOf(request) + request.body);
+}
+
+RawLines::~RawLines() {
+    close(_socket);
+}
+
+bool RawLines::receive() {
+    char part[4096];
+    const ssize_t count = recv(_socket, part, sizeof part, 0);
+    if (count > 0) _raw.append(part, static_cast<size_t>(count));
+    return count > 0;
+}
+
+bool RawLines::receiveUntil(const std::string& mark) {
+    while (_raw.find(mark) == std::string::npos)
+        if (!receive()) return false;
+    return true;
+}
+
+int RawLines::status() {
+    if (_status >= 0) return _status;
+    _status = 0;
+    if (!receiveUntil("\r\n\r\n") || !_raw.starts_with("HTTP/1.1 ")) return _status;
+    _status = std::stoi(_raw.substr(9, 3));
+    _raw.erase(0, _raw.find("\r\n\r\n") + 4);
+    return _status;
+}
+
+std::optional<std::string> RawLines::line() {
+    if (status() != 200) return std::nullopt;
+    while (_text.find('\n') == std::string::npos) {
+        if (_ended || !receiveUntil("\r\n")) return std::nullopt;
+        const size_t size = std::stoul(_raw, nullptr, 16), head = _raw.find("\r\n") + 2;
+        _ended = size == 0;
+        while (_raw.size() < head + size + 2)
+            if (!receive()) return std::nullopt;
+        _text += _raw.substr(head, size);
+        _raw.erase(0, head + size + 2);
+    }
+    const size_t end = _text.find('\n');
+    const std::string line = _text.substr(0, end);
+    _text.erase(0, end + 1);
+    return line;
+}
+
 } // namespace rolvane

@@ -45,4 +45,24 @@ private:
     std::string _rest;
 };
 
+// A request whose answer comes in lines for as long as the server likes.
+class RawLines {
+public:
+    RawLines(int port, const RawRequest& request);
+    ~RawLines();
+    RawLines(const RawLines&) = delete;
+    int status(); // 0: no answer
+    // Waits for the next line; nothing when the answer has ended, or nothing came for 60 seconds.
+    std::optional<std::string> line();
+    bool hasEnded() const { return _ended; } // properly, as chunked answers do
+
+private:
+    bool receive();
+    bool receiveUntil(const std::string& mark);
+    int _socket;
+    int _status = -1;
+    bool _ended = false;
+    std::string _raw, _text; // not looked at yet: as it came, and without the chunks' marks
+};
+
 } // namespace rolvane
