@@ -59,6 +59,7 @@ class Person:
             "DBUS_SESSION_BUS_ADDRESS": self.bus.address,
             "ROLVANE_MANAGER": os.path.join(self.build, "src/daemon/RolvaneManager"),
             "ROLVANE_LOG": "stderr",
+            "ROLVANE_NEWS": "never",  # each step shows what it has caused itself; bench/news.py takes it out
         }
         self.program = os.path.join(self.build, "apps/rolvane/rolvane")
 

@@ -14,7 +14,9 @@
 #include "daemon/DesktopAlert.h"
 #include "daemon/InstanceLock.h"
 #include "daemon/Leftovers.h"
+#include "daemon/NewsWatch.h"
 #include "daemon/OwnPasses.h"
+#include "daemon/StoreNewsRequest.h"
 #include "daemon/TerminationWatch.h"
 #include "engine/CXDSyncEngine.h"
 #include "engine/pass/OutcomeKeeper.h"
@@ -30,8 +32,11 @@
 #include <algorithm>
 #include <atomic>
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <optional>
+#include <random>
+#include <string_view>
 #include <sys/eventfd.h>
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
@@ -143,6 +148,7 @@ private:
             [&store] { releaseLocksOfEndedRuns(store); }, [&store] { return takeFailures(store); },
             [this](const PassOutcome& outcome) {
                 if (_ownPasses) _ownPasses->passEnded(resultOf(outcome));
+                if (_news) _news->passEnded(resultOf(outcome), treesOf(outcome));
             }});
         _progress.setEngine(engine.get(), engine.get());
         termination().engine = engine.get();
@@ -157,11 +163,13 @@ private:
         if (IdleExit::process().interval() != IdleExit::kNever)
             return network.startMonitoring(_loop, NotificationCenter::defaultCenter());
         _timer.emplace(_loop, [this] { _ownPasses->wake(); });
-        _sleep.emplace(_loop, [this] { _ownPasses->networkChanged(); });
+        _sleep.emplace(_loop, [this] { networkChanged(); });
         OwnPasses::World world;
         world.now = secondsSinceBoot;
         world.wakeAt = [this](std::optional<double> at) { _timer->set(at); };
-        world.lookInterval = [] { return lookInterval(); };
+        world.lookInterval = [this] {
+            return _news && _news->isLive() ? OwnPasses::lookIntervalWithNews(lookInterval()) : lookInterval();
+        };
         world.askStore = [&store] { return askStore(store); };
         world.pass = [] { ownPass(); };
         world.networkIsBack = [this] {
@@ -170,8 +178,44 @@ private:
         };
         _ownPasses.emplace(std::move(world));
         _networkChanged = _networkNews.observe(kCXNetworkConfigurationDidChangeNotification,
-                                               [this](const Notification&) { _ownPasses->networkChanged(); });
+                                               [this](const Notification&) { networkChanged(); });
+        makeNewsWatch(store);
         network.startMonitoring(_loop, _networkNews);
+    }
+
+    void makeNewsWatch(CXDAVManager& store) {
+        _newsTimer.emplace(_loop, [this] { _news->wake(); });
+        NewsWatch::World world;
+        world.now = secondsSinceBoot;
+        world.wakeAt = [this](std::optional<double> at) { _newsTimer->set(at); };
+        world.random = [this] { return std::uniform_real_distribution<double>(0, 1)(_random); };
+        world.isWanted = [] { return wantsNews(); };
+        world.open = [this, &store](const std::vector<Url>& trees, const std::string& position,
+                                    NewsWatch::Listener listener) {
+            return StoreNewsRequest::open(_loop, store, trees, position, std::move(listener));
+        };
+        world.news = [this](double spread) { _ownPasses->newsCame(spread); };
+        world.livelinessChanged = [this] { _ownPasses->lookIntervalChanged(); };
+        _news.emplace(std::move(world));
+    }
+
+    // Who never looks for other people's news by itself does not want to hear of them either. With the variable every
+    // pass has a cause that is known beforehand, as tests of everything else need it.
+    static bool wantsNews() {
+        const char* wish = std::getenv("ROLVANE_NEWS");
+        return lookInterval() > 0 && (!wish || std::string_view(wish) != "never");
+    }
+
+    void networkChanged() {
+        _ownPasses->networkChanged();
+        _news->networkChanged();
+    }
+
+    static std::vector<Url> treesOf(const PassOutcome& outcome) {
+        std::vector<Url> trees;
+        for (const PassTree& tree : outcome.trees)
+            if (!tree.ended) trees.emplace_back(tree.location);
+        return trees;
     }
 
     static double lookInterval() {
@@ -252,7 +296,9 @@ private:
     NotificationCenter _networkNews;
     ObservationHandle _networkChanged;
     std::optional<OwnPasses> _ownPasses; // none in a process that ends when it is idle
-    std::optional<BootTimer> _timer;
+    std::optional<BootTimer> _timer, _newsTimer;
+    std::optional<NewsWatch> _news; // as _ownPasses
+    std::mt19937 _random{std::random_device()()};
     std::optional<SleepWatch> _sleep;
     RunLoop::Handle _terminated;
 };

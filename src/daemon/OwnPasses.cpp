@@ -9,6 +9,19 @@ double OwnPasses::lookIntervalOf(std::optional<double> preference) {
     return *preference > 0 ? std::max(*preference, kShortestLook) : 0;
 }
 
+double OwnPasses::lookIntervalWithNews(double lookInterval) {
+    return lookInterval > 0 ? std::max(lookInterval, kLookIntervalWithNews) : 0;
+}
+
+void OwnPasses::newsCame(double spreadSeconds) {
+    _schedule.newsCame(_world.now() + spreadSeconds);
+    arm();
+}
+
+void OwnPasses::lookIntervalChanged() {
+    arm();
+}
+
 void OwnPasses::arm() {
     const auto next = _schedule.next(_world.lookInterval());
     _world.wakeAt(next ? std::optional(next->at) : std::nullopt);

@@ -13,7 +13,9 @@ public:
     static constexpr const char* kLookIntervalKey = "CXDLookInterval";
     static constexpr double kLookInterval = 300;                    // seconds, unless the preference says otherwise
     static constexpr double kShortestLook = 30;                     // a shorter one is taken for this
+    static constexpr double kLookIntervalWithNews = 1800;           // while the store tells of news by itself
     static double lookIntervalOf(std::optional<double> preference); // 0 and less: never
+    static double lookIntervalWithNews(double lookInterval);        // the same as long as news come by themselves
 
     struct Answer {
         bool isThere = false;
@@ -33,8 +35,10 @@ public:
     explicit OwnPasses(World world) : _world(std::move(world)) {}
 
     void passEnded(const PassResult& pass);
-    void networkChanged(); // also: the machine has slept
-    void wake();           // does what is due
+    void networkChanged();               // also: the machine has slept
+    void newsCame(double spreadSeconds); // the store tells of some: a pass, but not before
+    void lookIntervalChanged();
+    void wake(); // does what is due
 
 private:
     void arm();

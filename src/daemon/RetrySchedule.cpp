@@ -62,11 +62,14 @@ std::optional<RetrySchedule::Next> RetrySchedule::next(double lookInterval) cons
     if (_network) consider(What::network, allowedFrom(*_network));
     if (_failed) consider(_away ? What::ask : What::pass, allowedFrom(*_failed + pause()));
     if (lookInterval > 0 && _lastFull && !_away) consider(What::pass, allowedFrom(*_lastFull + lookInterval));
+    if (_news && !_away) consider(What::pass, allowedFrom(std::max(*_news, _restsUntil)));
     return first;
 }
 
 void RetrySchedule::beginsAttempt(double now) {
     _own = true;
+    _begun = now;
+    _news.reset();              // what comes from now on may come too late for it
     if (_failed) _failed = now; // should it lead to no pass after all, the next one is due after the pause
     if (_lastFull) _lastFull = now;
     _counted = _away || _network;
@@ -82,6 +85,8 @@ void RetrySchedule::count(double now) {
 // Attempts of the schedule's own make the pause longer; an edit in between, or somebody's command, does not.
 void RetrySchedule::ended(const PassResult& pass, double now) {
     const bool own = std::exchange(_own, false);
+    if (const auto begun = std::exchange(_begun, std::nullopt))
+        _restsUntil = now + std::clamp(2 * (now - *begun), 0.0, kLongestRest);
     if (own && pass.storeAway && !_counted) count(now);
     _away = pass.storeAway;
     _passwordRefused = pass.left && pass.passwordRefused;
@@ -101,6 +106,10 @@ void RetrySchedule::storeWasAway(double now, double retryAfter) {
     away.left = away.storeAway = true;
     away.retryAfter = retryAfter;
     ended(away, now);
+}
+
+void RetrySchedule::newsCame(double at) {
+    _news = _news ? std::min(*_news, at) : at;
 }
 
 void RetrySchedule::networkChanged(double now) {

@@ -29,6 +29,8 @@ PassResult resultOf(const PassOutcome& outcome);
 //   hour since the first of them. An attempt costs two requests at most: the question, and its repetition on a new
 //   connection or in another way.
 // - Not before the store wants to be asked again (Retry-After), but for kLongestRetryAfter at most.
+// - When the store tells of news, as soon as the last pass has ended and a rest of twice its length, kLongestRest at
+//   most, is over: while somebody else publishes, the store is not kept busy by readers.
 // - Else as soon as the last full pass, whoever wanted it, ended `lookInterval` ago: for other people's news.
 class RetrySchedule {
 public:
@@ -38,6 +40,7 @@ public:
     static constexpr double kLongestRetryAfter = 86400;
     static constexpr double kHour = 3600;
     static constexpr int kMostAttempts = 30;
+    static constexpr double kLongestRest = 30;
 
     enum class What {
         ask,     // whether the store is there; and make a pass when it is
@@ -55,6 +58,7 @@ public:
     void ended(const PassResult& pass, double now);   // of any pass
     void storeWasAway(double now, double retryAfter); // an attempt asked in vain, and made no pass
     void networkChanged(double now);                  // or the machine has slept
+    void newsCame(double at);                         // the store has told of some; a pass not before `at`
 
 private:
     double pause() const;
@@ -69,6 +73,9 @@ private:
     bool _away = false, _passwordRefused = false;
     double _notBefore = 0;
     std::optional<double> _lastFull, _network;
+    std::optional<double> _news;  // since when some wait for a pass
+    std::optional<double> _begun; // the attempt that is under way
+    double _restsUntil = 0;       // from passes for news
 };
 
 } // namespace rolvane

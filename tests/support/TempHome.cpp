@@ -53,6 +53,7 @@ TempHome::TempHome() {
     }
     setVariable("DBUS_SESSION_BUS_ADDRESS", std::nullopt);
     setVariable("ROLVANE_LOG", "stderr");
+    setVariable("ROLVANE_NEWS", "never"); // no pass comes unasked but in tests of that
 }
 
 TempHome::~TempHome() {

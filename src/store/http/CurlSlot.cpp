@@ -1,6 +1,7 @@
 #include "store/http/CurlSlot.h"
 
 #include "store/account/Account.h"
+#include "store/http/WriterName.h"
 
 #include <algorithm>
 #include <arpa/inet.h>
@@ -131,7 +132,8 @@ void CurlSlot::setMethod() {
 
 void CurlSlot::setHeaders() {
     const auto& wanted = _job->request.headers;
-    if (_headers && wanted == _headersShown) return;
+    const bool showsWriter = namesItsWriter(_job->request.method);
+    if (_headers && wanted == _headersShown && showsWriter == _writerShown) return;
     curl_slist_free_all(_headers);
     _headers = nullptr;
     bool hasType = false;
@@ -148,6 +150,8 @@ void CurlSlot::setHeaders() {
     add("Expect:");
     add("Accept-Encoding:");
     if (!hasType) add("Content-Type:");
+    if (showsWriter) add(kWriterHeader + (": " + writerName()));
+    _writerShown = showsWriter;
     _headersShown = wanted;
     curl_easy_setopt(_easy, CURLOPT_HTTPHEADER, _headers);
 }

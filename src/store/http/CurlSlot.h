@@ -82,6 +82,7 @@ private:
     CURL* _easy;
     curl_slist* _headers = nullptr;
     std::vector<std::pair<std::string, std::string>> _headersShown; // what `_headers` was built from
+    bool _writerShown = false;
     std::shared_ptr<const TransportCredentials> _signedInAs;
     const bool _offersHttp2;
     bool _http1Only = false;

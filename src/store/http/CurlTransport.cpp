@@ -23,6 +23,9 @@ namespace {
 using namespace std::chrono;
 using Steady = steady_clock;
 
+// How often deadlines are looked at; more seldom while nothing but patient requests is under way.
+constexpr auto kCheckPace = milliseconds(100), kPatientPace = milliseconds(5000);
+constexpr double kPatientSeconds = 60;
 constexpr double kStillSeconds = 0.2; // without a byte, of an answer that has begun
 constexpr double kNudgeDeadline = 10;
 // Without a request, after which every connection is closed: a store of a thousand daemons holds no place for those at
@@ -264,6 +267,7 @@ void CurlTransport::Impl::takeInbox() {
         std::lock_guard guard(inboxMutex);
         fresh.swap(inbox);
     }
+    if (!fresh.empty()) nextCheck = std::min(nextCheck, Steady::now() + kCheckPace);
     for (auto& job : fresh) {
         if (job->epoch < abortEpoch)
             fail(std::move(job), TransportError::aborted, "The program is ending.");
@@ -305,7 +309,7 @@ void CurlTransport::Impl::launch(std::unique_ptr<HttpJob> job) {
     const auto scheme = job->credentials ? job->credentials->scheme : TransportCredentials::Scheme::basic;
     const bool digest = scheme == TransportCredentials::Scheme::digest ||
                         (scheme == TransportCredentials::Scheme::automatic && digestOrigins.contains(job->origin));
-    if (active.empty()) nextCheck = Steady::now() + milliseconds(100);
+    nextCheck = active.empty() ? Steady::now() + kCheckPace : std::min(nextCheck, Steady::now() + kCheckPace);
     const bool shared = !job->http1Only && http2Origins.contains(job->origin);
     const long longestIdle = kept.longestIdle(job->origin, Steady::now());
     slot->prepare(std::move(job), {digest, shared, longestIdle});
@@ -402,7 +406,11 @@ bool CurlTransport::Impl::sendAgain(std::unique_ptr<HttpJob>& job) {
 void CurlTransport::Impl::checkDeadlines() {
     const SteadyTime now = Steady::now();
     if (now < nextCheck) return;
-    nextCheck = now + milliseconds(100);
+    const bool allPatient =
+        pending.empty() && !active.empty() && std::all_of(active.begin(), active.end(), [](const CurlSlot* slot) {
+            return slot->job()->request.limits.idleSeconds >= kPatientSeconds;
+        });
+    nextCheck = now + (allPatient ? kPatientPace : kCheckPace);
     std::vector<std::pair<CurlSlot*, std::string>> late;
     for (CurlSlot* slot : active) {
         const HttpLimits& limits = slot->job()->request.limits;

@@ -94,7 +94,9 @@ bool announcesDav(const HttpResponse& answer) {
     return announcesDavClass(answer, "1") || announcesDavClass(answer, "2") || announcesDavClass(answer, "3");
 }
 
-std::unique_ptr<CurlTransport> makeAccountTransport(const CXDAVAccount& account) {
+namespace {
+
+CurlTransportOptions transportOptions(const CXDAVAccount& account) {
     CurlTransportOptions options;
     options.caFile = account.caFile;
     options.userAgent = CXDAVManager::ostrelUserAgent();
@@ -103,7 +105,13 @@ std::unique_ptr<CurlTransport> makeAccountTransport(const CXDAVAccount& account)
     for (const std::string& origin : account.origins())
         options.http2 = options.http2 && !isLoopbackHost(Url(origin + "/").host());
     if (const char* wish = getenv("ROLVANE_HTTP2")) options.http2 = std::string_view(wish) == "always"; // measurements
-    return std::make_unique<CurlTransport>(std::move(options));
+    return options;
+}
+
+} // namespace
+
+std::unique_ptr<CurlTransport> makeAccountTransport(const CXDAVAccount& account) {
+    return std::make_unique<CurlTransport>(transportOptions(account));
 }
 
 StoreSession::StoreSession(CXDAVAccount account, std::shared_ptr<HttpTransport> transport, CurlTransport* signsIn)
@@ -293,7 +301,44 @@ bool StoreSession::heedOptions(const HttpResponse& answer) {
     _accessLists = announcesDavClass(answer, "access-control") ? 1 : 0;
     _membersTags = announcesDavClass(answer, kMembersTagClass);
     _mayKeepLocks = announcesDavClass(answer, "2");
+    heedNews(answer);
     return true;
+}
+
+// "Rolvane-News: /dav/ 0123456789abcdef": a path of the same origin, and the position of this moment.
+void StoreSession::heedNews(const HttpResponse& answer) {
+    constexpr size_t kLongest = 2000;
+    const std::string* offered = answer.header("rolvane-news");
+    const size_t blank = offered ? offered->find(' ') : std::string::npos;
+    const auto base = collectionEndpoint(_account.baseLocationFor(_account.user));
+    const std::lock_guard guard(_mutex);
+    const bool isUsable = blank != std::string::npos && offered->size() <= kLongest && offered->starts_with('/') &&
+                          !offered->starts_with("//") && base;
+    if (!isUsable) {
+        _news.reset();
+        return;
+    }
+    const std::string first = _news ? _news->firstPosition : offered->substr(blank + 1);
+    _news = {Url(base->origin() + offered->substr(0, blank)), first};
+}
+
+std::optional<StoreSession::NewsOffer> StoreSession::newsOffer() {
+    const std::lock_guard guard(_mutex);
+    return _news;
+}
+
+std::unique_ptr<CurlTransport> StoreSession::transportOfItsOwn() {
+    CurlTransportOptions options = transportOptions(_account);
+    options.http2 = false;
+    options.maxConnections = 1;
+    options.maxRetryAfterSeconds = 0;
+    auto transport = std::make_unique<CurlTransport>(std::move(options));
+    if (_account.passwordSource.kind == PasswordSource::Kind::none) return transport;
+    const auto secret = password();
+    if (!secret) return nullptr;
+    transport->setCredentials(
+        TransportCredentials{_account.user.str(), *secret, _account.origins(), schemeOf(_account.authentication)});
+    return transport;
 }
 
 // A tree that is not there yet: some servers refuse its OPTIONS, or never answer them. Then the next collection above

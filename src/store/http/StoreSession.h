@@ -68,6 +68,15 @@ public:
     bool givesMembersTags() const { return _membersTags; }
     // The same, or it has not been asked yet.
     bool mayGiveMembersTags() const { return _membersTags || _accessLists < 0; }
+    // Where the store tells news of trees to whoever waits, as it last said; nothing when it does not.
+    struct NewsOffer {
+        Url place;                 // on the account's own origin
+        std::string firstPosition; // that it gave in this run: nothing was read before
+    };
+    std::optional<NewsOffer> newsOffer();
+    // Another transport that signs in as this session does, over HTTP/1.1 and one connection; null when the password
+    // cannot be had.
+    std::unique_ptr<CurlTransport> transportOfItsOwn();
     // The password; absent, and the failed-password handler called, when it cannot be had.
     std::optional<std::string> password();
 
@@ -85,6 +94,7 @@ private:
     HttpResponse options();
     HttpResponse optionsAbove(HttpResponse ofTheTree);
     bool heedOptions(const HttpResponse& answer);
+    void heedNews(const HttpResponse& answer);
     std::vector<HttpResponse> optionsAndMore(std::vector<HttpRequest> requests);
     CXDAVError errorFrom(const HttpResponse& answer, const char* asked) const;
 
@@ -98,7 +108,8 @@ private:
     std::mutex _mutex; // guards the following
     std::optional<std::string> _password;
     bool _loginRefused = false; // a 401 was seen: ask for the password anew
-    bool _loginProven = false;  // a request that needs a login has succeeded
+    std::optional<NewsOffer> _news;
+    bool _loginProven = false; // a request that needs a login has succeeded
     std::atomic<bool> _signedIn{false};
     std::atomic<bool> _membersTags{false};
     std::atomic<bool> _mayKeepLocks{true};

@@ -1,0 +1,112 @@
+#include "daemon/NewsWatch.h"
+
+#include "foundation/Log.h"
+
+#include <algorithm>
+#include <cmath>
+#include <utility>
+
+namespace rolvane {
+
+namespace {
+constexpr int kUnauthorized = 401;
+}
+
+void NewsWatch::passEnded(const PassResult& pass, std::vector<Url> trees) {
+    _reached = !pass.storeAway && !pass.passwordRefused;
+    if (trees != _trees) { // not the request's fault
+        _trees = std::move(trees);
+        _request.reset();
+        _begun.reset();
+        _refusedBefore.clear();
+        _knowsRefused = false;
+    }
+    arm();
+}
+
+void NewsWatch::networkChanged() {
+    _request.reset();
+    _begun.reset();
+    _reached = false; // until a pass, which the change of the network brings about, has found the store
+    arm();
+}
+
+void NewsWatch::wake() {
+    arm();
+}
+
+void NewsWatch::arm() {
+    const bool wanted = _reached && !_trees.empty() && _world.isWanted();
+    if (_request && !_world.isWanted()) _request.reset();
+    if (!wanted && !_request) setLive(false);
+    if (_request || !wanted) return _world.wakeAt(std::nullopt);
+    if (_notBefore > _world.now()) return _world.wakeAt(_notBefore);
+    _world.wakeAt(std::nullopt);
+    open();
+}
+
+void NewsWatch::open() {
+    _begun.reset();
+    _refused.clear();
+    _request = _world.open(_trees, _position,
+                           {[this](const NewsLine& line) { take(line); }, [this](const NewsEnd& how) { end(how); }});
+    if (!_request) setLive(false);
+}
+
+void NewsWatch::take(const NewsLine& line) {
+    if (!line.position.empty()) _position = line.position;
+    switch (line.kind) {
+    case NewsLine::Kind::begin:
+        CXDLog("The store tells of news from now on.");
+        _begun = _world.now();
+        setLive(true);
+        return;
+    case NewsLine::Kind::no:
+        _refused.insert(line.tree);
+        // A right that has gone meanwhile is news as well. The pass finds out about it.
+        if (_knowsRefused && !_refusedBefore.contains(line.tree)) _world.news(_world.random() * kPassSpread);
+        return;
+    case NewsLine::Kind::news: return _world.news(_world.random() * kPassSpread);
+    case NewsLine::Kind::still: return;
+    }
+}
+
+double NewsWatch::pauseAfter(const NewsEnd& how) {
+    const double lived = _begun ? _world.now() - *_begun : 0;
+    if (lived >= kGood) {
+        _failures = 0;
+        return _world.random() * kSpread;
+    }
+    const bool refused = how.status >= 400;
+    const double first = refused ? kFirstPauseRefused : kFirstPause;
+    const double longest = refused ? kLongestPauseRefused : kLongestPause;
+    constexpr int kDoublings = 20; // by then it is the longest
+    const double pause = std::min(longest, first * std::exp2(std::min(_failures++, kDoublings)));
+    return pause * (1 + _world.random() / 4);
+}
+
+void NewsWatch::end(const NewsEnd& how) {
+    _request.reset();
+    if (_begun) {
+        _refusedBefore = _refused;
+        _knowsRefused = true;
+    }
+    const double pause = pauseAfter(how);
+    CXDLog("The store tells of no news any more (%s); it is asked again in %d seconds.",
+           how.whole    ? "it has ended the answer"
+           : how.status ? std::to_string(how.status)
+                        : how.detail,
+           static_cast<int>(pause));
+    const bool good = std::exchange(_begun, std::nullopt).has_value();
+    // Nobody answered, or the password is refused: the next pass finds out more. It comes as it would without this.
+    if (!good && (how.status == 0 || how.status == kUnauthorized)) _reached = false;
+    if (!good || _failures > 0) setLive(false);
+    _notBefore = _world.now() + pause;
+    arm();
+}
+
+void NewsWatch::setLive(bool live) {
+    if (std::exchange(_live, live) != live) _world.livelinessChanged();
+}
+
+} // namespace rolvane
