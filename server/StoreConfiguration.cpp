@@ -73,7 +73,7 @@ std::string renderStoreConfiguration(const std::string& templateText, const Priv
                      {"PROCESSES", std::to_string(processes)},
                      {"SERVER_LIMIT", std::to_string(2 * limit)},
                      {"THREADS", std::to_string(threads)},
-                     // A quarter of all connections of the process, so that there is room for others.
+                     // An eighth of all connections of the process, so that there is room for others.
                      {"NEWCOMERS", std::to_string(8 * threads)},
                      {"SPARE_THREADS", std::to_string(std::max(threads / 2, 1))},
                      {"WORKERS", std::to_string(threads * limit)},
