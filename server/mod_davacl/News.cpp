@@ -13,6 +13,9 @@ namespace {
 constexpr const char* kRetained = "davacl-news-1";
 constexpr const char* kClockFile = "dateFile";
 
+struct Retained {
+    NewsRing* ring;
+};
 NewsRing* ring = nullptr; // of the process, over restarts
 
 // Written by every pass of the tree's owner: it tells the store's time, and nothing that others read.
@@ -35,12 +38,12 @@ const char* prepareNews(server_rec* main) {
     bool wanted = false;
     for (const server_rec* each = main; each; each = each->next) wanted = wanted || givesNews(each);
     if (!wanted) return nullptr;
-    auto** kept = static_cast<NewsRing**>(ap_retained_data_get(kRetained));
+    auto* kept = static_cast<Retained*>(ap_retained_data_get(kRetained));
     if (!kept) {
-        kept = static_cast<NewsRing**>(ap_retained_data_create(kRetained, sizeof(NewsRing*)));
-        *kept = NewsRing::map();
+        kept = static_cast<Retained*>(ap_retained_data_create(kRetained, sizeof(Retained)));
+        kept->ring = NewsRing::map();
     }
-    ring = *kept;
+    ring = kept->ring;
     return ring ? nullptr : "there is no memory, or no random number, to tell news with";
 }
 
