@@ -368,7 +368,7 @@ std::vector<CXListing> listing(CXRolvane::Impl& d, std::initializer_list<RecordK
 
 std::vector<CXListing> CXRolvane::listPeople(const std::optional<RemoteLocation>& location, std::string_view text) {
     std::lock_guard lock(_impl->mutex);
-    return listing(*_impl, {RecordKind::person, RecordKind::subscribedPerson}, location, foldCase(text));
+    return listing(*_impl, {RecordKind::person, RecordKind::subscribedPerson}, location, cxFoldedForSearch(text));
 }
 
 namespace {
@@ -399,6 +399,31 @@ std::vector<CXListing> CXRolvane::peopleNamed(const std::string& named, Named ho
             const auto columns = deriveColumns(_impl->kind(uid), BinaryValue::decode(*row->encoded).dictionary());
             lines.push_back({columns.sort, {uid, columns.display, row->location}});
         }
+    return inOrder(std::move(lines));
+}
+
+std::vector<CXListing> CXRolvane::peopleBegun(const std::string& start, size_t most) {
+    std::lock_guard lock(_impl->mutex);
+    std::vector<CXListing> all;
+    for (auto& line : _impl->store.linesBegun(start, most))
+        all.push_back({line.uid, std::move(line.display), RemoteLocation(line.location)});
+    return all;
+}
+
+std::vector<CXListing> CXRolvane::peopleFound(const CXSearchQuery& query) {
+    std::lock_guard lock(_impl->mutex);
+    std::vector<SortedListing> lines;
+    const auto take = [&](RecordStore::Line& line) {
+        lines.push_back({std::move(line.sort), {line.uid, std::move(line.display), RemoteLocation(line.location)}});
+    };
+    for (auto& line : _impl->store.linesFound([&](std::string_view text) { return query.fits(text); }))
+        if (!_impl->work.isRecordWithChanges(line.uid)) take(line);
+    for (const auto& [uid, record] : _impl->work.inOrder()) {
+        if (!isPerson(_impl->kind(uid))) continue;
+        DerivedColumns columns = deriveColumns(_impl->kind(uid), _impl->properties(uid));
+        RecordStore::Line line{uid, columns.location, columns.display, columns.sort, {}};
+        if (query.fits(columns.search)) take(line);
+    }
     return inOrder(std::move(lines));
 }
 

@@ -6,6 +6,7 @@
 #include "contacts/records/CXGroup.h"
 #include "contacts/records/CXPerson.h"
 #include "contacts/records/CXSubscription.h"
+#include "contacts/records/SearchText.h"
 #include "foundation/Notification.h"
 #include "foundation/Preferences.h"
 #include "foundation/RunLoop.h"
@@ -117,12 +118,17 @@ public:
     // not be seen.
     void forEachMember(const CXGroup& group, const std::function<void(const CXRow&)>& call);
     // People of one location (empty: the owner's own; nothing: all) in display order; with a text, only those whose
-    // names, organisation, mails or phones contain it (letter case does not matter).
+    // names, organisation, mails, phones or note contain it (letter case and accents do not matter).
     std::vector<CXListing> listPeople(const std::optional<RemoteLocation>& location, std::string_view text = {});
     // People of all locations in display order whose name is `named`, or has it in it, or whose identifier begins so;
     // letter case of ASCII aside. By indexes: fast whatever the size of the database.
     enum class Named { whole, part, byIdentifier };
     std::vector<CXListing> peopleNamed(const std::string& named, Named how);
+    // Of the people whose name begins so, by name: the first ones and the last of all, not more than `most` (2 at
+    // least). Of what is saved; by an index, so that it is as fast for many people as for few.
+    std::vector<CXListing> peopleBegun(const std::string& start, size_t most);
+    // People of all locations in display order who have all of these words (contacts/records/SearchText.h).
+    std::vector<CXListing> peopleFound(const CXSearchQuery& query);
     // The rows of people, in this order, in pages. Those that are not here are passed over.
     void forEachOf(const std::vector<UniqueId>& uids, const std::function<void(const CXRow&)>& call);
     std::vector<CXListing> listGroups(const std::optional<RemoteLocation>& location); // by name

@@ -22,7 +22,7 @@ namespace rolvane {
 
 namespace {
 
-constexpr int kFormat = 6;
+constexpr int kFormat = 7;
 constexpr int64_t kApplicationId = 0x52564c43; // "RVLC"
 
 constexpr const char* kTables = R"(
@@ -43,6 +43,7 @@ CREATE INDEX records_modified ON records(kind, modified);
 CREATE INDEX records_location ON records(kind, location, id, uid);
 CREATE INDEX records_names ON records(id, uid, kind);
 CREATE INDEX records_display ON records(display COLLATE NOCASE, kind, uid, location, sort);
+CREATE INDEX records_search ON records(id, kind, search);
 CREATE TABLE listed(
   group_id INTEGER NOT NULL REFERENCES records(id) ON DELETE CASCADE,
   position INTEGER NOT NULL,
@@ -163,6 +164,7 @@ void RecordStore::makeOrCheckFormat() {
     if (format == 3) format = addCommonVersions();
     if (format == 4) format = addDisplayNames();
     if (format == 5) format = addDaemonMemory();
+    if (format == 6) format = addSearchTexts();
     if (format > kFormat)
         throw CXException(kCXDatabaseException, "The contact database " + _database.path() +
                                                     " was written by a newer version (format " +
@@ -214,6 +216,30 @@ int64_t RecordStore::addDaemonMemory() {
     SqliteTransaction transaction(_database);
     if (_database.integer("PRAGMA user_version") == 5) // nobody else did it meanwhile
         _database.execute(std::string(MemoryTable::kTable) + "PRAGMA user_version=6;");
+    transaction.commit();
+    return _database.integer("PRAGMA user_version");
+}
+
+// Up to format 6 the search text knew accents, and neither notes nor the digits of phones; it was read with the rows.
+int64_t RecordStore::addSearchTexts() {
+    SqliteTransaction transaction(_database);
+    if (_database.integer("PRAGMA user_version") == 6) { // nobody else did it meanwhile
+        auto set = _database.statement("UPDATE records SET search=?2 WHERE id=?1");
+        forEachRowOfTable(
+            [&](const TableRow& row) {
+                Dictionary properties;
+                try {
+                    properties = BinaryValue::decode(row.properties).dictionary();
+                } catch (const CXException&) { // whoever reads the row is told
+                    return;
+                }
+                set.bind(1, row.id).bind(2, std::string_view(deriveColumns(row.kind, properties).search)).run();
+                set.reset();
+            },
+            true);
+        _database.execute("CREATE INDEX IF NOT EXISTS records_search ON records(id, kind, search); "
+                          "PRAGMA user_version=7;");
+    }
     transaction.commit();
     return _database.integer("PRAGMA user_version");
 }
@@ -484,6 +510,41 @@ std::vector<RecordStore::Line> RecordStore::linesNamed(std::string_view name, bo
     s.bind(1, name);
     std::vector<Line> lines;
     while (s.step()) lines.push_back({UniqueId(s.text(0)), s.text(1), s.text(2), s.text(3), ""});
+    return lines;
+}
+
+std::vector<RecordStore::Line> RecordStore::linesBegun(std::string_view start, size_t most) {
+    const std::string behind = std::string(start) + "\xFF"; // no UTF-8 text has this byte
+    SqliteSnapshot snapshot(_database);
+    std::vector<Line> lines;
+    const auto read = [&](const char* order, size_t limit) {
+        auto s = _database.statement("SELECT uid, location, display, sort FROM records INDEXED BY records_display "
+                                     "WHERE display>=?1 COLLATE NOCASE AND display<?2 COLLATE NOCASE "
+                                     "AND kind IN (1,2) ORDER BY display COLLATE NOCASE " +
+                                     std::string(order) + " LIMIT ?3");
+        s.bind(1, start).bind(2, std::string_view(behind)).bind(3, static_cast<int64_t>(limit));
+        while (s.step()) lines.push_back({UniqueId(s.text(0)), s.text(1), s.text(2), s.text(3), ""});
+    };
+    read("ASC", most + 1);
+    if (lines.size() <= most) return lines;
+    lines.resize(most - 1);
+    read("DESC", 1);
+    return lines;
+}
+
+std::vector<RecordStore::Line> RecordStore::linesFound(const std::function<bool(std::string_view)>& passes) {
+    SqliteSnapshot snapshot(_database);
+    std::vector<int64_t> ids;
+    auto texts = _database.statement("SELECT id, kind, search FROM records INDEXED BY records_search");
+    while (texts.step())
+        if (isPerson(static_cast<RecordKind>(texts.integer(1))) && passes(texts.textView(2)))
+            ids.push_back(texts.integer(0));
+    auto row = _database.statement("SELECT uid, location, display, sort FROM records WHERE id=?");
+    std::vector<Line> lines;
+    for (const int64_t id : ids) {
+        if (row.bind(1, id).step()) lines.push_back({UniqueId(row.text(0)), row.text(1), row.text(2), row.text(3), ""});
+        row.reset();
+    }
     return lines;
 }
 

@@ -81,6 +81,10 @@ public:
     };
     // The same of the people whose name is this (letter case of ASCII aside), or has this in it; by an index of names.
     std::vector<Line> linesNamed(std::string_view name, bool partOfName);
+    // The same of the people whose name begins so, by name: the first ones and the last of all, not more than `most`.
+    std::vector<Line> linesBegun(std::string_view start, size_t most);
+    // The same of the people whose search text passes, which is seen for the time of the call alone.
+    std::vector<Line> linesFound(const std::function<bool(std::string_view)>& passes);
     // Identifiers of people that begin so, letter case aside.
     std::vector<UniqueId> peopleWhoseIdentifierBegins(std::string_view start);
     // Rows with their parents, in this order; those that are not there are left out.
@@ -132,6 +136,7 @@ private:
     int64_t addCommonVersions();
     int64_t addDisplayNames();
     int64_t addDaemonMemory();
+    int64_t addSearchTexts();
     void fillNewDatabase();
     [[noreturn]] void outOfOrder();
     std::vector<CXRow> rowsWithParents(Sqlite::Statement& s, int positionColumn, int64_t& position);

@@ -2,6 +2,7 @@
 
 #include "contacts/records/CXMultiValue.h"
 #include "contacts/records/CXPerson.h"
+#include "contacts/records/SearchText.h"
 
 #include <array>
 #include <clocale>
@@ -33,29 +34,12 @@ void append(std::string& text, const Value& value) {
     text += value.string();
 }
 
-void appendAll(std::string& text, const Value& value) {
-    if (!CXMultiValue::isMultiValue(value)) return;
-    Array values = (*value.dictionaryIf())["values"].array();
-    for (const Value& v : values) append(text, v);
-}
-
 std::string sortText(const Dictionary& p) {
     std::string text;
     append(text, p[kCXLastNameProperty]);
     append(text, p[kCXFirstNameProperty]);
     append(text, p[kCXMiddleNameProperty]);
     return text.empty() ? cxDisplayName(p) : text;
-}
-
-std::string searchText(const Dictionary& p) {
-    std::string text;
-    for (const char* key : {kCXFirstNameProperty, kCXMiddleNameProperty, kCXLastNameProperty, kCXNicknameProperty,
-                            kCXMaidenNameProperty, kCXFormattedNameProperty, kCXOrganizationProperty,
-                            kCXDepartmentProperty, kCXFirstNamePhoneticProperty, kCXLastNamePhoneticProperty})
-        append(text, p[key]);
-    appendAll(text, p[kCXEmailProperty]);
-    appendAll(text, p[kCXPhoneProperty]);
-    return text;
 }
 
 locale_t utf8Locale() {
@@ -130,11 +114,12 @@ DerivedColumns deriveColumns(RecordKind kind, const Dictionary& properties) {
     if (isPerson(kind)) {
         columns.display = cxDisplayName(properties);
         columns.sort = foldCase(sortText(properties));
-        columns.search = foldCase(searchText(properties));
+        columns.search = cxSearchText(properties);
     } else {
         columns.display =
             properties[kind == RecordKind::subscription ? kCXSubscriptionNameProperty : kCXGroupNameProperty].string();
-        columns.sort = columns.search = foldCase(columns.display);
+        columns.sort = foldCase(columns.display);
+        columns.search = cxFoldedForSearch(columns.display);
     }
     return columns;
 }
