@@ -79,6 +79,7 @@ bench:
 	bench/run build/bench
 	bench/longlist.py build/bench
 	bench/signin.py build/bench
+	bench/naming.py build/bench
 
 lint:
 	@packaging/setup build test lint

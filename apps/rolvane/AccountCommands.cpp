@@ -1,6 +1,7 @@
 #include "Context.h"
 #include "FailureText.h"
 #include "Terminal.h"
+#include "ValueNames.h"
 
 #include "daemon/DaemonControl.h"
 #include "daemon/RetrySchedule.h"
@@ -220,7 +221,7 @@ void addAccountCommands(CLI::App& app, Context& context) {
             c.add_option("--secure-endpoint", o->secureEndpoint,
                          "The https endpoint of the same store, when --endpoint is plain http");
             c.add_option("--host", o->host, "Host in the names of locations; the endpoint's, unless given");
-            c.add_option("--ca-file", o->caFile, "PEM file of a private certificate authority");
+            c.add_option("--ca-file", o->caFile, "PEM file of a private certificate authority")->type_name(kFileValue);
             c.add_option("--authentication", o->authentication, "automatic, basic or digest")
                 ->check(CLI::IsMember({"automatic", "basic", "digest"}));
             auto* password = c.add_option_group("password", "Where the password comes from; it is never an argument");
@@ -228,7 +229,7 @@ void addAccountCommands(CLI::App& app, Context& context) {
                                "Ask for it (or read a line of standard input) and keep it in a file of mode 0600");
             password->add_option("--password-command", o->passwordCommand, "Command whose first line of output it is");
             password->add_option("--password-credential", o->passwordCredential, "Name of a systemd credential");
-            password->add_option("--password-file", o->passwordFile, "File of mode 0600");
+            password->add_option("--password-file", o->passwordFile, "File of mode 0600")->type_name(kFileValue);
             password->add_flag("--no-password", o->noPassword, "The store asks for none");
             password->require_option(0, 1);
             c.add_flag("--plain-loopback,!--no-plain-loopback", o->plainLoopback,

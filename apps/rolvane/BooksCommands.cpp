@@ -2,6 +2,7 @@
 #include "BooksAutostart.h"
 #include "Counted.h"
 #include "QrCode.h"
+#include "ValueNames.h"
 
 #include "foundation/Date.h"
 #include "foundation/Paths.h"
@@ -215,7 +216,8 @@ void addBooksCommands(CLI::App& app, Context& context) {
     books->require_subcommand(1);
     const auto o = std::make_shared<ServerOptions>();
     const auto directory = [o](CLI::App& c) {
-        c.add_option("--directory", o->directory, "The server's own directory, for several servers");
+        c.add_option("--directory", o->directory, "The server's own directory, for several servers")
+            ->type_name(kDirectoryValue);
     };
     CLI::App* on = addCommand(
         *books, context, "on", "Serve them on this machine; returns when the server answers",
@@ -248,7 +250,9 @@ void addBooksCommands(CLI::App& app, Context& context) {
     device->require_subcommand(1);
     const auto named = [&, directory, o](CLI::App& c) {
         directory(c);
-        c.add_option("name", o->device, "A name of your choice: the user name of the device")->required();
+        c.add_option("name", o->device, "A name of your choice: the user name of the device")
+            ->required()
+            ->type_name(kDeviceValue);
     };
     addCommand(
         *device, context, "add", "Make a password for a program or device, and show it once",

@@ -2,6 +2,7 @@
 #include "BooksLink.h"
 #include "Lookup.h"
 #include "Terminal.h"
+#include "ValueNames.h"
 
 #include "contacts/records/Identifier.h"
 #include "foundation/Paths.h"
@@ -177,14 +178,17 @@ std::string linkText(const Json& link) {
 
 void addBooksLinkCommands(CLI::App& books, Context& context) {
     const auto o = std::make_shared<LinkOptions>();
-    const auto group = [o](CLI::App& c) { c.add_option("-g,--group", o->group, "A group's book instead of Contacts"); };
+    const auto group = [o](CLI::App& c) {
+        c.add_option("-g,--group", o->group, "A group's book instead of Contacts")->type_name(kGroupValue);
+    };
     addCommand(
         books, context, "link", "Keep a book in step with one on another CardDAV server, by vdirsyncer",
         [&, group](CLI::App& c) {
             c.add_option("url", o->url, "The other address book's own address")->required();
             c.add_option("--user", o->user, "User name there; the password is asked for, or a line of standard input");
             c.add_option("--password-command", o->passwordCommand, "A command that prints the password");
-            c.add_option("--ca-file", o->caFile, "Authority to trust there (PEM), when it is not a public one");
+            c.add_option("--ca-file", o->caFile, "Authority to trust there (PEM), when it is not a public one")
+                ->type_name(kFileValue);
             group(c);
         },
         [&context, o] { link(context, *o); });
@@ -194,7 +198,9 @@ void addBooksLinkCommands(CLI::App& books, Context& context) {
     // For vdirsyncer; nobody types it.
     addCommand(
         books, context, "merge-cards", "Make one card of two",
-        [&](CLI::App& c) { c.add_option("cards", o->cards, "Two files")->required()->expected(2); },
+        [&](CLI::App& c) {
+            c.add_option("cards", o->cards, "Two files")->type_name(kFileValue)->required()->expected(2);
+        },
         [o] { mergeCards(*o); })
         ->group("");
 }

@@ -1,6 +1,7 @@
 #include "Conflicts.h"
 #include "Context.h"
 #include "RecordJson.h"
+#include "ValueNames.h"
 
 #include "contacts/records/Constants.h"
 
@@ -104,7 +105,7 @@ void addConflictCommands(CLI::App& app, Context& context) {
     conflicts->require_subcommand(1);
     const auto number = std::make_shared<int64_t>();
     const auto numbered = [number](CLI::App& command) {
-        command.add_option("number", *number, "Number in the list")->required();
+        command.add_option("number", *number, "Number in the list")->required()->type_name(kConflictValue);
     };
     addCommand(*conflicts, context, "list", "List what was kept, and what gave way", nullptr,
                [&context] { listConflicts(context); });

@@ -6,6 +6,7 @@
 #include "RecordJson.h"
 #include "SafeText.h"
 #include "Subscriptions.h"
+#include "ValueNames.h"
 
 #include "contacts/vcard/TextCharset.h"
 #include "contacts/vcard/VCardExport.h"
@@ -139,7 +140,8 @@ void exportCards(Context& context, const ExportOptions& options) {
     context.say(fmt::format("{} cards written.", cards));
 }
 
-// list and show ----------------------------------------------------------------------------------------------------
+// list, search and show
+// ----------------------------------------------------------------------------------------------------
 
 struct ListOptions {
     std::string text, group;
@@ -215,12 +217,28 @@ void listText(Context& context, const std::vector<CXListing>& people) {
     });
 }
 
-void list(Context& context, const ListOptions& options) {
-    const std::vector<CXListing> people = chosenPeople(context, options);
-    if (context.json) return listJson(context, people, options.full);
-    if (!options.full) return listText(context, people);
+void tell(Context& context, const std::vector<CXListing>& people, bool full) {
+    if (context.json) return listJson(context, people, full);
+    if (!full) return listText(context, people);
     for (const CXListing& person : people)
         context.line(fmt::format("{}  {}{}", person.uniqueId.str(), shownLine(person.displayName), ownerMark(person)));
+}
+
+void list(Context& context, const ListOptions& options) {
+    tell(context, chosenPeople(context, options), options.full);
+}
+
+void search(Context& context, const std::vector<std::string>& words, bool full) {
+    std::string text;
+    for (const std::string& word : words) text += (text.empty() ? "" : " ") + word;
+    const CXSearchQuery query(text);
+    if (query.empty()) throw CommandError(kUsage, "Name a word to search for.");
+    const std::vector<CXListing> people = context.database().peopleFound(query);
+    if (people.empty() && !context.json)
+        throw CommandError(kNotFound,
+                           fmt::format("Nobody has \"{}\" in name, organisation, mail, phone or note.", text));
+    tell(context, people, full);
+    if (people.empty()) context.exitCode = kNotFound;
 }
 
 void show(Context& context, const std::vector<std::string>& names) {
@@ -304,6 +322,7 @@ void addContactCommands(CLI::App& app, Context& context) {
                 .add_option("files", imports->files,
                             "vCards (2.1, 3.0 or 4.0), CSV of Google, Outlook or Thunderbird, LDIF of Thunderbird; "
                             "- reads standard input")
+                ->type_name(kFileValue)
                 ->required();
             command.add_option("--charset", imports->charset,
                                "Character set of text that is not UTF-8 and names none, such as WINDOWS-1252; without "
@@ -316,9 +335,12 @@ void addContactCommands(CLI::App& app, Context& context) {
     addCommand(
         app, context, "export", "Write contacts and groups as vCards",
         [&](CLI::App& command) {
-            command.add_option("names", exports->names, "People, by name or identifier; without any, everything");
-            command.add_option("-g,--group", exports->group, "The members of this group, and its subgroups");
-            command.add_option("-o,--output", exports->output, "File to write; without it, standard output");
+            command.add_option("names", exports->names, "People, by name or identifier; without any, everything")
+                ->type_name(kPersonValue);
+            command.add_option("-g,--group", exports->group, "The members of this group, and its subgroups")
+                ->type_name(kGroupValue);
+            command.add_option("-o,--output", exports->output, "File to write; without it, standard output")
+                ->type_name(kFileValue);
             command.add_option("--vcard", exports->version, "vCard version, 3 or 4")
                 ->check(CLI::IsMember({"3", "4"}))
                 ->capture_default_str();
@@ -329,17 +351,34 @@ void addContactCommands(CLI::App& app, Context& context) {
     addCommand(
         app, context, "list", "List people",
         [&](CLI::App& command) {
-            command.add_option("text", lists->text, "Only those with this text in name, organisation, mail or phone");
-            command.add_option("-g,--group", lists->group, "Only members of this group");
+            command.add_option("text", lists->text,
+                               "Only those with this text in name, organisation, mail, phone or note");
+            command.add_option("-g,--group", lists->group, "Only members of this group")->type_name(kGroupValue);
             declareWhose(command, lists->whose);
             command.add_flag("--full", lists->full, "With the identifiers; with --json, every property");
         },
         [&context, lists] { list(context, *lists); });
 
+    const auto words = std::make_shared<std::vector<std::string>>();
+    const auto whole = std::make_shared<bool>();
+    addCommand(
+        app, context, "search", "Find people by words of name, organisation, mail, phone or note",
+        [&](CLI::App& command) {
+            command
+                .add_option("words", *words,
+                            "Each of them is in the person; letter case, accents and the spelling of a phone number do "
+                            "not matter")
+                ->required();
+            command.add_flag("--full", *whole, "With the identifiers; with --json, every property");
+        },
+        [&context, words, whole] { search(context, *words, *whole); });
+
     const auto shown = std::make_shared<std::vector<std::string>>();
     addCommand(
         app, context, "show", "Show people with all they have",
-        [&](CLI::App& command) { command.add_option("names", *shown, "Names or identifiers")->required(); },
+        [&](CLI::App& command) {
+            command.add_option("names", *shown, "Names or identifiers")->required()->type_name(kPersonValue);
+        },
         [&context, shown] { show(context, *shown); });
 
     const auto added = std::make_shared<PersonFields>();
@@ -349,6 +388,7 @@ void addContactCommands(CLI::App& app, Context& context) {
         [&](CLI::App& command) {
             added->declare(command, false);
             command.add_option("-g,--group", *groups, "Make the person a member of this group")
+                ->type_name(kGroupValue)
                 ->allow_extra_args(false);
         },
         [&context, added, groups] { add(context, *added, *groups); });
@@ -358,7 +398,7 @@ void addContactCommands(CLI::App& app, Context& context) {
     addCommand(
         app, context, "edit", "Change a person; an empty text takes a field away",
         [&](CLI::App& command) {
-            command.add_option("name", *named, "Name or identifier")->required();
+            command.add_option("name", *named, "Name or identifier")->required()->type_name(kPersonValue);
             edited->declare(command, true);
         },
         [&context, edited, named] { edit(context, *named, *edited); });
@@ -368,7 +408,7 @@ void addContactCommands(CLI::App& app, Context& context) {
     addCommand(
         app, context, "delete", "Delete people; a part of a name is not enough",
         [&](CLI::App& command) {
-            command.add_option("names", *deleted, "Names or identifiers")->required();
+            command.add_option("names", *deleted, "Names or identifiers")->required()->type_name(kPersonValue);
             command.add_flag("-y,--yes", *yes, "Do not ask");
         },
         [&context, deleted, yes] { remove(context, *deleted, *yes); });

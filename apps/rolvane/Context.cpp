@@ -1,7 +1,9 @@
 #include "Context.h"
 
 #include "Examples.h"
+#include "ProgressLine.h"
 #include "SafeText.h"
+#include "Terminal.h"
 
 #include "contacts/database/DaemonMemory.h"
 #include "contacts/database/DamagedDatabase.h"
@@ -11,7 +13,6 @@
 #include <cmath>
 #include <fmt/format.h>
 #include <iostream>
-#include <sys/ioctl.h>
 #include <unistd.h>
 
 namespace rolvane::cli {
@@ -77,9 +78,7 @@ bool Context::dataIsTerminal() const {
 }
 
 size_t Context::dataColumns() const {
-    winsize size{};
-    if (!dataIsTerminal() || ::ioctl(STDOUT_FILENO, TIOCGWINSZ, &size) != 0) return 0;
-    return size.ws_col;
+    return terminalColumns(STDOUT_FILENO);
 }
 
 ProgressBar::ProgressBar(Context& context, std::string label) : _context(context), _label(std::move(label)) {}
@@ -95,10 +94,7 @@ void ProgressBar::update(double fraction, const std::string& note) {
     if (_context.talkIsTerminal()) {
         if (percent == _shown) return;
         _shown = percent;
-        constexpr int width = 40;
-        const int full = percent * width / 100;
-        std::cerr << fmt::format("\r{} [{}{}] {:3}% {}\033[K", _label, std::string(static_cast<size_t>(full), '#'),
-                                 std::string(static_cast<size_t>(width - full), ' '), percent, shownLine(note))
+        std::cerr << "\r" << progressLine(_label, percent, shownLine(note), terminalColumns(STDERR_FILENO)) << "\033[K"
                   << std::flush;
         _open = true;
         return;

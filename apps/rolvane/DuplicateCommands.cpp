@@ -2,6 +2,7 @@
 #include "Counted.h"
 #include "Lookup.h"
 #include "SafeText.h"
+#include "ValueNames.h"
 
 #include "contacts/records/PersonJoining.h"
 
@@ -156,8 +157,10 @@ void addDuplicateCommands(CLI::App& app, Context& context) {
     addCommand(
         app, context, "merge", "Make one person of several",
         [&](CLI::App& command) {
-            command.add_option("names", options->names,
-                               "Names or identifiers; the first one stays. One name: all who are called so");
+            command
+                .add_option("names", options->names,
+                            "Names or identifiers; the first one stays. One name: all who are called so")
+                ->type_name(kPersonValue);
             command.add_flag("--alike", options->alike,
                              "All who have the same name and an address or number in common");
             command.add_flag("--dry-run", options->dryRun, "Tell what would happen, and change nothing");

@@ -18,6 +18,10 @@ const std::map<std::string, const char*>& examples() {
         {"list", "  rolvane list miller\n"
                  "  rolvane list --group Family --json --full\n"
                  "  rolvane list --of bob"},
+        {"search", "  rolvane search zurich fair\n"
+                   "  rolvane search +49 170 1234567"},
+        {"help", "  rolvane help group add\n"
+                 "  rolvane help exit-codes"},
         {"show", "  rolvane show \"Ada Miller\"\n"
                  "  rolvane show 4CA70A2B --json"},
         {"add", "  rolvane add --first Ada --last Miller --phone \"mobile:+1 555 0100\" --group Family"},
@@ -47,6 +51,9 @@ const std::map<std::string, const char*>& examples() {
         {"unshare", "  rolvane unshare bob"},
         {"shares", "  rolvane shares --json"},
         {"rights", "  rolvane rights bob"},
+        {"who", "  rolvane who \"Ada Miller\""},
+        {"preview", "  rolvane preview bob\n"
+                    "  rolvane preview bob --json"},
         {"withdrawn list", "  rolvane withdrawn list"},
         {"withdrawn import", "  rolvane withdrawn import bob"},
         {"conflicts list", "  rolvane conflicts list"},
@@ -83,10 +90,14 @@ const std::map<std::string, const char*>& examples() {
 
 } // namespace
 
-std::string helpFooter(const std::string& path) {
+std::string exampleOf(const std::string& path) {
     const auto found = examples().find(path);
-    const std::string codes = "`rolvane --help` lists the exit codes.";
-    return found == examples().end() ? codes : "Examples:\n" + std::string(found->second) + "\n\n" + codes;
+    return found == examples().end() ? "" : found->second;
+}
+
+std::string helpFooter(const std::string& path) {
+    const std::string lines = exampleOf(path), codes = "`rolvane --help` lists the exit codes.";
+    return lines.empty() ? codes : "Examples:\n" + lines + "\n\n" + codes;
 }
 
 } // namespace rolvane::cli

@@ -3,6 +3,7 @@
 #include "Publication.h"
 #include "RecordJson.h"
 #include "Subscriptions.h"
+#include "ValueNames.h"
 
 #include "contacts/records/Constants.h"
 
@@ -171,7 +172,9 @@ void addGroupCommands(CLI::App& app, Context& context) {
     CLI::App* group = addCommand(app, context, "group", "Groups: list, make, fill, rename", nullptr, nullptr);
     group->require_subcommand(1);
     const auto o = std::make_shared<GroupOptions>();
-    const auto groupArgument = [o](CLI::App& c) { c.add_option("group", o->group, "Name or identifier")->required(); };
+    const auto groupArgument = [o](CLI::App& c) {
+        c.add_option("group", o->group, "Name or identifier")->required()->type_name(kGroupValue);
+    };
     const auto with = [&](const char* name, const char* help, const std::function<void(CLI::App&)>& more,
                           std::function<void()> body) {
         addCommand(
@@ -182,8 +185,12 @@ void addGroupCommands(CLI::App& app, Context& context) {
             },
             std::move(body));
     };
-    const auto people = [o](CLI::App& c) { c.add_option("people", o->names, "Names or identifiers")->required(); };
-    const auto groups = [o](CLI::App& c) { c.add_option("subgroups", o->names, "Names or identifiers")->required(); };
+    const auto people = [o](CLI::App& c) {
+        c.add_option("people", o->names, "Names or identifiers")->required()->type_name(kPersonValue);
+    };
+    const auto groups = [o](CLI::App& c) {
+        c.add_option("subgroups", o->names, "Names or identifiers")->required()->type_name(kGroupValue);
+    };
 
     const auto whose = std::make_shared<Whose>();
     addCommand(
@@ -193,7 +200,7 @@ void addGroupCommands(CLI::App& app, Context& context) {
         *group, context, "create", "Make a group; prints the identifier",
         [&](CLI::App& c) {
             c.add_option("name", o->name, "The group's name")->required();
-            c.add_option("people", o->names, "Members, by name or identifier");
+            c.add_option("people", o->names, "Members, by name or identifier")->type_name(kPersonValue);
         },
         [&context, o] { createGroup(context, *o); });
     with("show", "Show members, groups in it and choices", nullptr, [&context, o] { showGroup(context, o->group); });
@@ -210,7 +217,7 @@ void addGroupCommands(CLI::App& app, Context& context) {
     with(
         "choose", "Choose which of a member's values the group uses",
         [o](CLI::App& c) {
-            c.add_option("person", o->person, "The member")->required();
+            c.add_option("person", o->person, "The member")->required()->type_name(kPersonValue);
             c.add_option("property", o->property, "Email, Phone or Address")
                 ->required()
                 ->check(CLI::IsMember({kCXEmailProperty, kCXPhoneProperty, kCXAddressProperty}));

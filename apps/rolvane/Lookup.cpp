@@ -3,9 +3,11 @@
 #include "Context.h"
 #include "SafeText.h"
 #include "Subscriptions.h"
+#include "Suggestions.h"
 
 #include <algorithm>
 #include <fmt/format.h>
+#include <functional>
 
 namespace rolvane::cli {
 
@@ -41,11 +43,17 @@ std::vector<CXListing> matches(const std::vector<CXListing>& all, const std::str
     return chosen([&](const CXListing& l) { return folded(l.displayName).find(wanted) != std::string::npos; });
 }
 
-UniqueId only(const std::vector<CXListing>& found, const std::string& kind, const std::string& named) {
+// `everybody` gives all that there is of the kind, for one who mistyped a name.
+UniqueId only(const std::vector<CXListing>& found, const std::string& kind, const std::string& named,
+              const std::function<std::vector<CXListing>()>& everybody) {
     if (found.size() == 1) return found.front().uniqueId;
-    if (found.empty())
-        throw CommandError(kNotFound, fmt::format("There is no {} \"{}\". `rolvane {}` lists what there is.", kind,
-                                                  named, kind == "group" ? "group list" : "list"));
+    if (found.empty()) {
+        std::vector<std::string> names;
+        for (const CXListing& listing : everybody()) names.push_back(shownLine(listing.displayName));
+        throw CommandError(kNotFound,
+                           fmt::format("There is no {} \"{}\".{} `rolvane {}` lists what there is.", kind, named,
+                                       didYouMean(suggestions(named, names)), kind == "group" ? "group list" : "list"));
+    }
     constexpr size_t kShown = 10;
     std::string list;
     for (size_t i = 0; i < std::min(found.size(), kShown); ++i)
@@ -77,13 +85,15 @@ std::vector<CXListing> peopleMatching(CXRolvane& database, const std::string& na
 
 CXPersonRef findPerson(CXRolvane& database, const std::string& named, bool whole) {
     if (auto exact = std::dynamic_pointer_cast<CXPerson>(database.recordForUniqueId(UniqueId(named)))) return exact;
-    const UniqueId uid = only(peopleMatching(database, named, whole), "person", named);
+    const UniqueId uid = only(peopleMatching(database, named, whole), "person", named,
+                              [&] { return database.listPeople(std::nullopt); });
     return std::dynamic_pointer_cast<CXPerson>(database.recordForUniqueId(uid));
 }
 
 CXGroupRef findGroup(CXRolvane& database, const std::string& named, bool whole) {
     if (auto exact = std::dynamic_pointer_cast<CXGroup>(database.recordForUniqueId(UniqueId(named)))) return exact;
-    const UniqueId uid = only(matches(database.listGroups(std::nullopt), named, whole), "group", named);
+    const auto groups = database.listGroups(std::nullopt);
+    const UniqueId uid = only(matches(groups, named, whole), "group", named, [&] { return groups; });
     return std::dynamic_pointer_cast<CXGroup>(database.recordForUniqueId(uid));
 }
 

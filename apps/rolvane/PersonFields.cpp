@@ -1,6 +1,7 @@
 #include "PersonFields.h"
 
 #include "Context.h"
+#include "ValueNames.h"
 
 #include "contacts/records/Constants.h"
 #include "foundation/Paths.h"
@@ -117,7 +118,7 @@ void PersonFields::declare(CLI::App& command, bool editing) {
     for (size_t i = 0; i < singles().size(); ++i)
         given.push_back(command.add_option(singles()[i].option, values[i], singles()[i].help));
     command.add_option("--birthday", birthday, "Birthday, as 1980-12-31");
-    command.add_option("--photo", photo, "File with a PNG, JPEG, GIF or WebP picture");
+    command.add_option("--photo", photo, "File with a PNG, JPEG, GIF or WebP picture")->type_name(kFileValue);
     // One value each time that the option is given: what follows the value is not taken for another one.
     const auto several = [&](const char* name, std::vector<std::string>& texts, const char* help) {
         command.add_option(name, texts, help)->allow_extra_args(false);

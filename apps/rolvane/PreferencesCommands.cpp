@@ -1,5 +1,6 @@
 #include "Context.h"
 #include "RecordJson.h"
+#include "ValueNames.h"
 
 #include "foundation/Preferences.h"
 #include "foundation/PropertyList.h"
@@ -82,14 +83,14 @@ void addPreferencesCommands(CLI::App& app, Context& context) {
         *defaults, context, "read", "Show one value, or all of the domain",
         [&](CLI::App& c) {
             domain(c);
-            c.add_option("key", o->key, "The key");
+            c.add_option("key", o->key, "The key")->type_name(kKeyValue);
         },
         [&context, o] { read(context, *o); });
     addCommand(
         *defaults, context, "write", "Set a value; a running daemon reads most of them when it starts",
         [&](CLI::App& c) {
             domain(c);
-            c.add_option("key", o->key, "The key")->required();
+            c.add_option("key", o->key, "The key")->required()->type_name(kKeyValue);
             c.add_option("value", o->value, "The value")->required();
             c.add_option("-t,--type", o->type, "string, int, real, bool, date or plist (XML text)")
                 ->check(CLI::IsMember({"string", "int", "real", "bool", "date", "plist"}))
@@ -100,7 +101,7 @@ void addPreferencesCommands(CLI::App& app, Context& context) {
         *defaults, context, "delete", "Remove a value",
         [&](CLI::App& c) {
             domain(c);
-            c.add_option("key", o->key, "The key")->required();
+            c.add_option("key", o->key, "The key")->required()->type_name(kKeyValue);
         },
         [&context, o] { remove(context, *o); });
 }

@@ -5,6 +5,7 @@
 #include "Publication.h"
 #include "Shares.h"
 #include "Subscriptions.h"
+#include "ValueNames.h"
 
 #include "acl/CXDAVACLManager.h"
 #include "daemon/DaemonControl.h"
@@ -283,8 +284,8 @@ void showRights(Context& context, const std::string& named) {
 
 void addShareCommands(CLI::App& app, Context& context) {
     const auto o = std::make_shared<ShareOptions>();
-    const auto common = [o](CLI::App& command) {
-        command.add_option("user", o->user, "User name on the store")->required();
+    const auto common = [o](CLI::App& command, const char* kind) {
+        command.add_option("user", o->user, "User name on the store")->required()->type_name(kind);
         command.add_flag("--no-wait", o->noWait, "Return as soon as the daemon is at work");
         command.add_flag("--no-daemon", o->noDaemon, "Only note it; do not start the daemon");
         command.add_option("--timeout", o->timeout, "Seconds to wait for the pass")
@@ -294,18 +295,21 @@ void addShareCommands(CLI::App& app, Context& context) {
     addCommand(
         app, context, "share", "Let another user of the store read what you publish, or change it, too",
         [&](CLI::App& command) {
-            common(command);
+            common(command, kUserValue);
             command.add_flag("--write", o->write, "Changes are allowed; without it reading only");
         },
         [&context, o] { changeShares(context, *o, true); });
-    addCommand(app, context, "unshare", "Take a user's rights back", common,
-               [&context, o] { changeShares(context, *o, false); });
+    addCommand(
+        app, context, "unshare", "Take a user's rights back", [&](CLI::App& command) { common(command, kReaderValue); },
+        [&context, o] { changeShares(context, *o, false); });
     addCommand(app, context, "shares", "List who may read and who may write, since when, and whether the store agrees",
                nullptr, [&context] { listShares(context); });
     const auto named = std::make_shared<std::string>();
     addCommand(
         app, context, "rights", "Tell what you may do with another user's contacts",
-        [&](CLI::App& command) { command.add_option("user", *named, "User name or location")->required(); },
+        [&](CLI::App& command) {
+            command.add_option("user", *named, "User name or location")->required()->type_name(kUserValue);
+        },
         [&context, named] { showRights(context, *named); });
 }
 

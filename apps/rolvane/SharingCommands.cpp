@@ -5,6 +5,7 @@
 #include "PassReport.h"
 #include "Passes.h"
 #include "Publication.h"
+#include "ValueNames.h"
 
 #include "daemon/DaemonControl.h"
 #include "store/dav/CXDAVManager.h"
@@ -152,7 +153,8 @@ void addSharingCommands(CLI::App& app, Context& context) {
     addCommand(
         app, context, "publish", "Publish the contact list, or single groups, on the store",
         [&](CLI::App& command) {
-            command.add_option("-g,--group", options->group, "Publish this group only (name or identifier)");
+            command.add_option("-g,--group", options->group, "Publish this group only (name or identifier)")
+                ->type_name(kGroupValue);
             command.add_flag("--no-wait", options->noWait, "Return as soon as the daemon is at work");
             command.add_flag("--no-daemon", options->noDaemon, "Only note it; do not start the daemon");
             command.add_option("--timeout", options->timeout, "Seconds to wait for the pass")
@@ -163,7 +165,8 @@ void addSharingCommands(CLI::App& app, Context& context) {
     addCommand(
         app, context, "unpublish", "Withdraw a publication and take its files off the store",
         [&](CLI::App& command) {
-            command.add_option("-g,--group", options->group, "Withdraw this group only (name or identifier)");
+            command.add_option("-g,--group", options->group, "Withdraw this group only (name or identifier)")
+                ->type_name(kGroupValue);
             command.add_flag("--keep", options->keep, "Leave the files on the store");
         },
         [&context, options] { unpublish(context, *options); });

@@ -1,5 +1,6 @@
 #include "Context.h"
 #include "Terminal.h"
+#include "ValueNames.h"
 
 #include "server/PrivateStore.h"
 
@@ -87,13 +88,14 @@ void addStoreCommands(CLI::App& app, Context& context) {
     store->require_subcommand(1);
     const auto o = std::make_shared<StoreOptions>();
     const auto directory = [o](CLI::App& c) {
-        c.add_option("--directory", o->directory, "The store's own directory; several stores have one each");
+        c.add_option("--directory", o->directory, "The store's own directory; several stores have one each")
+            ->type_name(kDirectoryValue);
     };
     CLI::App* startCommand = addCommand(
         *store, context, "start", "Start it on a free loopback port; returns when it answers",
         [&](CLI::App& c) {
             directory(c);
-            c.add_option("--root", o->root, "Where the published files lie");
+            c.add_option("--root", o->root, "Where the published files lie")->type_name(kDirectoryValue);
             c.add_option("--port", o->port, "Port; the one of the last start, else a free one");
             c.add_option("--authentication", o->authentication,
                          "basic, digest (keeps what is as good as the passwords) or none")
@@ -122,7 +124,7 @@ void addStoreCommands(CLI::App& app, Context& context) {
     user->require_subcommand(1);
     const auto named = [&, directory, o](CLI::App& c) {
         directory(c);
-        c.add_option("user", o->user, "User name")->required();
+        c.add_option("user", o->user, "User name")->required()->type_name(kStoreUserValue);
     };
     addCommand(*user, context, "add", "Add a user, or set a new password (asked for, or a line of standard input)",
                named, [&context, o] {

@@ -4,6 +4,7 @@
 #include "Passes.h"
 #include "Publication.h"
 #include "Subscriptions.h"
+#include "ValueNames.h"
 
 #include "conduits/PublishedLayout.h"
 #include "daemon/DaemonControl.h"
@@ -205,7 +206,9 @@ void addSubscriptionCommands(CLI::App& app, Context& context) {
     addCommand(
         app, context, "subscribe", "Take what another user has published, and keep it in step",
         [&](CLI::App& command) {
-            command.add_option("user", options->named, "User name on the store, or a location")->required();
+            command.add_option("user", options->named, "User name on the store, or a location")
+                ->required()
+                ->type_name(kUserValue);
             command.add_flag("--no-wait", options->noWait, "Return as soon as the daemon is at work");
             command.add_flag("--no-daemon", options->noDaemon, "Only note it; do not start the daemon");
             command.add_option("--timeout", options->timeout, "Seconds to wait for the pass")
@@ -216,7 +219,9 @@ void addSubscriptionCommands(CLI::App& app, Context& context) {
     const auto named = std::make_shared<std::string>();
     addCommand(
         app, context, "unsubscribe", "End a subscription; what came by it leaves this database",
-        [&](CLI::App& command) { command.add_option("user", *named, "User name or location")->required(); },
+        [&](CLI::App& command) {
+            command.add_option("user", *named, "User name or location")->required()->type_name(kPublisherValue);
+        },
         [&context, named] { unsubscribe(context, *named); });
     addCommand(app, context, "subscriptions", "List the subscriptions: whose, how much, and what you may do", nullptr,
                [&context] { listSubscriptions(context); });

@@ -2,6 +2,7 @@
 
 #include "Context.h"
 #include "Publication.h"
+#include "ValueNames.h"
 
 #include "conduits/PublishedLayout.h"
 #include "engine/memory/EngineState.h"
@@ -92,7 +93,8 @@ CXSubscriptionRef findSubscription(CXRolvane& database, const std::string& named
 }
 
 void declareWhose(CLI::App& command, Whose& whose) {
-    CLI::Option* of = command.add_option("--of", whose.publisher, "Only what came from this user (or location)");
+    CLI::Option* of = command.add_option("--of", whose.publisher, "Only what came from this user (or location)")
+                          ->type_name(kPublisherValue);
     command.add_flag("--own", whose.own, "Only your own")->excludes(of);
 }
 

@@ -1,6 +1,7 @@
 #include "Terminal.h"
 
 #include <iostream>
+#include <sys/ioctl.h>
 #include <termios.h>
 #include <unistd.h>
 
@@ -22,6 +23,12 @@ std::string readSecret(const std::string& prompt) {
     ::tcsetattr(STDIN_FILENO, TCSAFLUSH, &shown);
     std::cerr << "\n";
     return secret;
+}
+
+size_t terminalColumns(int descriptor) {
+    winsize size{};
+    if (::isatty(descriptor) != 1 || ::ioctl(descriptor, TIOCGWINSZ, &size) != 0) return 0;
+    return size.ws_col;
 }
 
 } // namespace rolvane::cli

@@ -1,6 +1,7 @@
 #include "Context.h"
 #include "Counted.h"
 #include "ImportReport.h"
+#include "ValueNames.h"
 #include "Withdrawn.h"
 
 #include "contacts/database/WithdrawnContacts.h"
@@ -80,7 +81,9 @@ void addWithdrawnCommands(CLI::App& app, Context& context) {
     withdrawn->require_subcommand(1);
     const auto named = std::make_shared<std::string>();
     const auto name = [named](CLI::App& command) {
-        command.add_option("name", *named, "Name in the list, or the publisher's")->required();
+        command.add_option("name", *named, "Name in the list, or the publisher's")
+            ->required()
+            ->type_name(kWithdrawnValue);
     };
     addCommand(*withdrawn, context, "list", "List whose left, when, how many, and where they are kept", nullptr,
                [&context] { listWithdrawn(context); });

@@ -1,5 +1,11 @@
+#include "CompleteCommand.h"
+#include "Completion.h"
 #include "Context.h"
+#include "HelpCommand.h"
+#include "ManualCommand.h"
 #include "SafeText.h"
+#include "SeeingCommands.h"
+#include "Suggestions.h"
 
 #include <iostream>
 
@@ -8,13 +14,8 @@ namespace {
 constexpr const char* kDescription =
     "Rolvane shares parts of your contacts with other people and keeps every copy in step.";
 
-constexpr const char* kFooter = R"(Exit codes:
-  0  done                      4  part of the input was refused; each refusal is named
-  1  it could not be done      5  not allowed
-  2  wrong command line        6  the store or the daemon was not reached in time
-  3  no such thing, or several of that name
-
-Data goes to standard output, messages to standard error. `rolvane COMMAND --help` tells more.
+constexpr const char* kFooter =
+    R"(Data goes to standard output, messages to standard error. `rolvane COMMAND --help` tells more.
 
 Examples:
   rolvane import friends.vcf
@@ -46,6 +47,12 @@ std::string nameOf(const CLI::App& command) {
     return (command.get_parent() ? nameOf(*command.get_parent()) + " " : "") + command.get_name();
 }
 
+std::vector<std::string> namesBelow(const CLI::App& command) {
+    std::vector<std::string> names;
+    for (const CLI::App* below : rolvane::cli::shownCommands(command)) names.push_back(below->get_name());
+    return names;
+}
+
 // Help and version go to standard output; what is wrong with the line goes to standard error, with what to do.
 int endWith(const CLI::App& app, const CLI::ParseError& error, int argc, char** argv) {
     using namespace rolvane::cli;
@@ -58,7 +65,8 @@ int endWith(const CLI::App& app, const CLI::ParseError& error, int argc, char** 
     std::string what =
         unknown.empty() ? error.what() : "There is no command \"" + nameOf(*command) + " " + unknown + "\"";
     if (what.ends_with('.')) what.pop_back();
-    std::cerr << shownText("rolvane: " + what + ". `" + nameOf(*command) + " --help` shows what can be given.\n");
+    std::cerr << shownText("rolvane: " + what + "." + didYouMean(suggestions(unknown, namesBelow(*command))) + " `" +
+                           nameOf(*command) + " --help` shows what can be given.\n");
     return kUsage;
 }
 
@@ -70,7 +78,7 @@ int main(int argc, char** argv) {
 
     CLI::App app(kDescription, "rolvane");
     Context context;
-    app.footer(kFooter);
+    app.footer(exitCodeLines() + "\n" + kFooter);
     app.set_version_flag("--version", "rolvane " ROLVANE_VERSION);
     app.require_subcommand(1);
     app.fallthrough();
@@ -90,8 +98,12 @@ int main(int argc, char** argv) {
     addStoreCommands(app, context);
     addBooksCommands(app, context);
     addDatabaseCommands(app, context);
+    addSeeingCommands(app, context);
+    addHelpCommand(app, context);
 
     try {
+        if (argc > 1 && std::string_view(argv[1]) == "complete") return complete(app, argc, argv);
+        if (argc > 1 && std::string_view(argv[1]) == "manual") return manual(app, argc, argv);
         app.parse(argc, argv);
         std::cout.flush();
         if (!std::cout) {

@@ -1,5 +1,7 @@
 #include "daemon/Daemon.h"
 
+#include "daemon/DaemonOptions.h"
+
 #include "conduits/WithdrawalNotice.h"
 #include "conduits/database/CXDCXConduit.h"
 #include "conduits/store/CXDVaultraConduit.h"
@@ -94,7 +96,7 @@ public:
 
     void parseArguments(int argc, char** argv) {
         for (int i = 1; i < argc; ++i)
-            if (std::strcmp(argv[i], "-p") == 0) IdleExit::process().setInterval(0);
+            if (std::strcmp(argv[i], kEndWhenIdle.name) == 0) IdleExit::process().setInterval(0);
     }
 
     void listen(const std::string& path) { _channel.listen(path); }

@@ -1,0 +1,163 @@
+#include "SeeingCommands.h"
+
+#include "Counted.h"
+#include "Lookup.h"
+#include "Publication.h"
+#include "RecordJson.h"
+#include "SafeText.h"
+#include "Shares.h"
+#include "Subscriptions.h"
+#include "ValueNames.h"
+
+#include <algorithm>
+#include <fmt/format.h>
+#include <map>
+#include <set>
+
+namespace rolvane::cli {
+
+namespace {
+
+using Json = nlohmann::ordered_json;
+
+constexpr const char* kEverything = "all your contacts";
+
+const char* rightsOf(const Shares& shares, const std::string& user) {
+    return shares.mayWrite(user) ? "write" : "read";
+}
+
+const char* rightsText(const Json& rights) {
+    return rights == "write" ? "read and write" : "read";
+}
+
+// Through what the person is published: all contacts, or groups by name.
+std::vector<std::string> publishedThrough(CXRolvane& database, const CXPerson& person) {
+    const Publication publication(database);
+    if (publication.everything()) return {kEverything};
+    std::vector<std::string> names;
+    for (const CXGroupRef& group : publication.groups()) {
+        const auto members = group->memberUniqueIds();
+        if (std::find(members.begin(), members.end(), person.uniqueId()) != members.end())
+            names.push_back(group->name());
+    }
+    return names;
+}
+
+std::string listed(const std::vector<std::string>& names) {
+    std::string text;
+    for (const std::string& name : names) text += (text.empty() ? "" : ", ") + shownLine(name);
+    return text;
+}
+
+void who(Context& context, const std::string& named) {
+    CXRolvane& database = context.database();
+    const CXPersonRef person = findPerson(database, named);
+    const std::string name = shownLine(person->displayName());
+    if (person->isSubscribed()) {
+        const std::string owner = publisherOf(person->remoteLocation());
+        if (context.json)
+            return context.print({{"identifier", person->uniqueId().str()},
+                                  {"name", person->displayName()},
+                                  {"owner", owner},
+                                  {"through", nullptr},
+                                  {"readers", nullptr}});
+        return context.say(fmt::format("{} is {}'s contact: {} decides who can see it.", name, owner, owner));
+    }
+    const std::vector<std::string> through = publishedThrough(database, *person);
+    const Shares shares(database);
+    Json readers = Json::array();
+    if (!through.empty())
+        for (const std::string& user : shares.readers())
+            readers.push_back({{"user", user}, {"rights", rightsOf(shares, user)}});
+    if (context.json)
+        return context.print({{"identifier", person->uniqueId().str()},
+                              {"name", person->displayName()},
+                              {"owner", nullptr},
+                              {"through", through},
+                              {"readers", readers}});
+    for (const Json& reader : readers)
+        context.line(fmt::format("{}  {}, through {}", reader["user"].get<std::string>(), rightsText(reader["rights"]),
+                                 listed(through)));
+    if (through.empty())
+        context.say(fmt::format("Nobody but you: {} is in nothing that you publish.", name));
+    else if (readers.empty())
+        context.say(fmt::format("Nobody but you: {} is published through {}, but you share with nobody.", name,
+                                listed(through)));
+}
+
+struct Preview {
+    std::vector<CXListing> people;
+    std::vector<CXGroupRef> groups;
+};
+
+// What the owner's tree holds for everybody who may read it.
+Preview published(CXRolvane& database) {
+    const Publication publication(database);
+    Preview preview;
+    preview.people = database.listPeople(RemoteLocation(""));
+    if (publication.everything()) {
+        for (const CXListing& listing : database.listGroups(RemoteLocation("")))
+            if (auto group = std::dynamic_pointer_cast<CXGroup>(database.recordForUniqueId(listing.uniqueId)))
+                preview.groups.push_back(std::move(group));
+        return preview;
+    }
+    preview.groups = publication.groups();
+    std::set<UniqueId> members;
+    for (const CXGroupRef& group : preview.groups)
+        for (const UniqueId& uid : group->memberUniqueIds()) members.insert(uid);
+    std::erase_if(preview.people, [&](const CXListing& listing) { return !members.contains(listing.uniqueId); });
+    return preview;
+}
+
+void preview(Context& context, const std::string& user) {
+    CXRolvane& database = context.database();
+    const Shares shares(database);
+    if (!Publication(database).anything())
+        throw CommandError(kNotFound, fmt::format("\"{}\" gets nothing: nothing is published. `rolvane publish` comes "
+                                                  "first.",
+                                                  user));
+    if (!shares.mayRead(user))
+        throw CommandError(kNotFound, fmt::format("\"{}\" gets nothing: you do not share with them. `rolvane shares` "
+                                                  "lists with whom you do.",
+                                                  user));
+    const Preview all = published(database);
+    if (context.json) {
+        Json people = Json::array(), groups = Json::array();
+        for (const CXListing& listing : all.people)
+            people.push_back({{"identifier", listing.uniqueId.str()}, {"name", listing.displayName}});
+        for (const CXGroupRef& group : all.groups)
+            groups.push_back({{"identifier", group->uniqueId().str()},
+                              {"name", group->name()},
+                              {"members", group->memberUniqueIds().size()}});
+        return context.print(
+            {{"user", user}, {"rights", rightsOf(shares, user)}, {"people", people}, {"groups", groups}});
+    }
+    for (const CXGroupRef& group : all.groups)
+        context.line(fmt::format("{}  ({})", shownLine(group->name()),
+                                 counted(group->memberUniqueIds().size(), "member", "members")));
+    for (const CXListing& listing : all.people) context.line(shownLine(listing.displayName));
+    context.say(fmt::format("\"{}\" may {} {} and {}, as soon as the store has them.", user,
+                            shares.mayWrite(user) ? "read and change" : "read",
+                            counted(all.people.size(), "person", "people"),
+                            counted(all.groups.size(), "group", "groups")));
+}
+
+} // namespace
+
+void addSeeingCommands(CLI::App& app, Context& context) {
+    const auto named = std::make_shared<std::string>();
+    addCommand(
+        app, context, "who", "Tell who can see a contact, and through what",
+        [&](CLI::App& command) {
+            command.add_option("person", *named, "Name or identifier")->required()->type_name(kPersonValue);
+        },
+        [&context, named] { who(context, *named); });
+    addCommand(
+        app, context, "preview", "Show what a user with whom you share gets",
+        [&](CLI::App& command) {
+            command.add_option("user", *named, "User name on the store")->required()->type_name(kReaderValue);
+        },
+        [&context, named] { preview(context, *named); });
+}
+
+} // namespace rolvane::cli
