@@ -59,6 +59,7 @@ void NewsWatch::take(const NewsLine& line) {
     case NewsLine::Kind::begin:
         CXDLog("The store tells of news from now on.");
         _begun = _world.now();
+        _hasBegun = true;
         setLive(true);
         return;
     case NewsLine::Kind::no:
@@ -98,9 +99,10 @@ void NewsWatch::end(const NewsEnd& how) {
                         : how.detail,
            static_cast<int>(pause));
     const bool good = std::exchange(_begun, std::nullopt).has_value();
-    // Nobody answered, or the password is refused: the next pass finds out more. It comes as it would without this.
+    // Nobody answered, or the password is refused: the next pass finds out more.
     if (!good && (how.status == 0 || how.status == kUnauthorized)) _reached = false;
     if (!good || _failures > 0) setLive(false);
+    if (!good && how.status == 0 && std::exchange(_hasBegun, false)) _world.news(_world.random() * kSpread);
     _notBefore = _world.now() + pause;
     arm();
 }

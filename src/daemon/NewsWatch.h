@@ -18,7 +18,8 @@ namespace rolvane {
 // and no pass fails. Main thread. A process that ends when it is idle has none of these.
 //
 // A new request is made when the last pass has reached the store: at a random moment within kSpread after one that was
-// good for a while, else after growing pauses. So a store that is away is not asked by it.
+// good for a while, else after growing pauses. So a store that is away is not asked by it; when a request that was good
+// cannot be made again, one pass finds out whether the store is away, and asks for it as ever.
 class NewsWatch {
 public:
     static constexpr double kSpread = 5;       // seconds: not all daemons come at once after a restart of the store
@@ -74,7 +75,8 @@ private:
     bool _knowsRefused = false;                // from an earlier request for the same trees
     std::string _position;                     // up to which everything has been told; "" before the first line
     bool _live = false, _reached = false;
-    int _failures = 0; // in a row
+    bool _hasBegun = false; // an answer, since the store was last not there
+    int _failures = 0;      // in a row
     double _notBefore = 0;
     std::optional<double> _begun; // when the answer of the request began
 };

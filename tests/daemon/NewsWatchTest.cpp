@@ -177,8 +177,10 @@ TEST(NewsWatch, AsksAStoreThatIsAwayOnce) {
     EXPECT_EQ(w.opened, 2);
     w.end(0);
     EXPECT_FALSE(w.watch.isLive());
+    EXPECT_EQ(w.news, 1) << "a pass is to find out";
     w.go(100000);
     EXPECT_EQ(w.opened, 2) << "a pass is to find the store first";
+    EXPECT_EQ(w.news, 1);
     w.passEnded(false);
     w.go(100000);
     EXPECT_EQ(w.opened, 2);
