@@ -361,7 +361,7 @@ TEST(WaitingForNews, EndsWhenItIsCutOrSilentBehindItsBeginning) {
     AskedStore silent(chunked({"begin a 45\n"}, false, false));
     silent.wait(0.5);
     ASSERT_TRUE(waitUntil([&] { return silent.hasEnded(); }, "the silence"));
-    EXPECT_EQ(silent.lines.size(), 1U);
+    EXPECT_EQ(silent.end->status, 0); // on a slow machine before its beginning has come
     EXPECT_FALSE(silent.end->whole);
     FakeAnswer never;
     never.silent = true;
