@@ -91,6 +91,9 @@ public:
     // refused: what the source holds instead counts as not seen yet, so that the next comparison offers it. Base:
     // nothing.
     virtual void wasRefused(const CXDChangeRecord& /*record*/) {}
+    // These are about to be applied, on other threads. The contact database is saved before the first of them. Main
+    // thread. Base: nothing.
+    virtual void willWrite(const CXDChangeRecords& /*records*/) {}
 
     // Contacts that an apply has merged with a version of somebody else's: as updates for the contact database, since
     // the last call. Base: none.

@@ -3,6 +3,7 @@
 #include "engine/queue/RefusedChanges.h"
 
 #include "engine/memory/EngineState.h"
+#include "model/PayloadKeys.h"
 
 #include "TwoUsers.h"
 
@@ -218,6 +219,34 @@ TEST_P(RefusedByOwnStore, WhereOnlyGroupsAreRefusedNothingIsLost) {
     passHours();
     afterTheRefusal();
     expectEverythingArrived(saved);
+}
+
+// The list names the only contact, whose file the store has never had. Taken for a tree that has lost its contacts, it
+// would be published again, and keep the name.
+TEST_P(RefusedByOwnStore, TheOnlyContactThatIsRefusedAndDeletedLeavesNoName) {
+    for (const CXPersonRef& person : people) alice.application->removeRecord(person);
+    alice.application->save();
+    settle();
+    store->refuse("contacts");
+    const CXPersonRef dora = alice.add("Dora");
+    friends->addMember(dora);
+    alice.application->save();
+    alice.pass();
+    alice.application->removeRecord(dora);
+    alice.application->save();
+    const auto saved = alice.view();
+    store->refuseNothing();
+    alice.pass(); // while the refused change rests
+    alice.loop.runOnce(0);
+    afterTheRefusal();
+    expectEverythingArrived(saved);
+    for (const std::string list : {std::string("AllCXGroup"), cxNormalizedUID(friends->uniqueId()).str()}) {
+        int code = 0;
+        const auto state = alice.manager.dictionaryAtURL(
+            alice.manager.account().baseLocationFor(UserName("alice")).cxURLByAppendingComponent(list), false, &code);
+        ASSERT_TRUE(state) << list << " " << code;
+        EXPECT_FALSE((*state)[kMemberUIDState].array().containsString(dora->uniqueId().str())) << list;
+    }
 }
 
 TEST_P(RefusedByOwnStore, ARestartInBetweenForgetsNothing) {

@@ -39,27 +39,44 @@ bool ContactWrites::put(const Place& place, const Dictionary& content, int& code
     return _manager.write(PropertyList::toXML(content), place.location, CXDVaultraConduit::kSecureRecordWrites, &code);
 }
 
+void ContactWrites::willWrite(const Url& location, const UniqueId& uniqueId,
+                              const std::function<Dictionary()>& content) {
+    if (_rolvane.commonVersion(uniqueId) || _manager.remembersVersion(location)) return;
+    _new.insert(uniqueId);
+    _rolvane.setCommonVersion(uniqueId, encoded(content()));
+}
+
 bool ContactWrites::write(const Place& place, const Dictionary& ours, int& code) {
     bool done = false;
-    // A contact that no store is known to have had is written as it is.
-    if (!place.merges || (!_rolvane.commonVersion(place.uniqueId) && !_manager.remembersVersion(place.location))) {
+    if (!place.merges) {
         done = put(place, ours, code);
     } else {
-        for (int attempt = 0; attempt < kAttempts && !done; ++attempt) {
-            const auto there = _manager.readVersion(place.location, CXDVaultraConduit::kSecureRecordWrites, &code);
-            if (there.failed) return false;
-            const bool isKnown = !there.contact || there.isKnown;
-            if (!there.contact)
-                done = writeWhereNoneIs(place, ours, code);
-            else
-                done = isKnown ? put(place, ours, code)
-                               : writeMerged(place, ours, *there.contact, there.lastModified, code);
-            if (!done && !isKnown) _manager.forgetVersion(place.location); // it was read, and nobody has it
-            if (!done && code != kChangedMeanwhile) return false;
-        }
+        const bool isNew = _new.contains(place.uniqueId) ||
+                           (!_rolvane.commonVersion(place.uniqueId) && !_manager.remembersVersion(place.location));
+        // Nothing says that a store has had the contact. It may have come there all the same.
+        if (isNew) _manager.expectAbsence(place.location, CXDVaultraConduit::kSecureRecordWrites);
+        done = isNew && put(place, ours, code);
+        if (!done && (!isNew || code == kChangedMeanwhile)) done = writeOver(place, ours, code);
     }
     if (done) _rolvane.setCommonVersion(place.uniqueId, encoded(ours));
     return done;
+}
+
+bool ContactWrites::writeOver(const Place& place, const Dictionary& ours, int& code) {
+    for (int attempt = 0; attempt < kAttempts; ++attempt) {
+        const auto there = _manager.readVersion(place.location, CXDVaultraConduit::kSecureRecordWrites, &code);
+        if (there.failed) return false;
+        if (!there.contact) {
+            if (writeWhereNoneIs(place, ours, code)) return true;
+        } else if (there.isKnown) {
+            if (put(place, ours, code)) return true;
+        } else {
+            if (writeMerged(place, ours, *there.contact, there.lastModified, code)) return true;
+            _manager.forgetVersion(place.location); // it was read, and nobody has it
+        }
+        if (code != kChangedMeanwhile) return false;
+    }
+    return false;
 }
 
 // The list of everybody says whether the store has lost the file or somebody has deleted the contact. Without the list

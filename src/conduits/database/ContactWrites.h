@@ -8,6 +8,7 @@
 #include <functional>
 #include <mutex>
 #include <optional>
+#include <unordered_set>
 #include <vector>
 
 namespace rolvane {
@@ -31,6 +32,11 @@ class ContactWrites {
 public:
     // Both borrowed.
     ContactWrites(CXDAVManager& manager, CXRolvane& rolvane) : _manager(manager), _rolvane(rolvane) {}
+
+    // Before the writes of a pass, on its main thread. A contact that no store is known to have had gets this content
+    // as the common version, in the unit of work: should the pass come to no end, the store has it, or has nothing.
+    void beginPass() { _new.clear(); }
+    void willWrite(const Url& location, const UniqueId& uniqueId, const std::function<Dictionary()>& content);
 
     struct Place {
         UserName user;                   // of the tree
@@ -56,12 +62,14 @@ public:
 
 private:
     bool put(const Place& place, const Dictionary& content, int& code);
+    bool writeOver(const Place& place, const Dictionary& ours, int& code);
     bool writeWhereNoneIs(const Place& place, const Dictionary& ours, int& code);
     bool writeMerged(const Place& place, const Dictionary& ours, const Dictionary& theirs,
                      const std::optional<Date>& theirDate, int& code);
 
     CXDAVManager& _manager;
     CXRolvane& _rolvane;
+    std::unordered_set<UniqueId> _new; // of this pass; constant while it writes
     std::mutex _lock;
     std::vector<Merged> _merged; // guarded by _lock
 };

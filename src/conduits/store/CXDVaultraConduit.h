@@ -70,6 +70,7 @@ public:
     using CXDConduit::applyChangeRecord;
     bool applyChangeRecord(const CXDChangeRecordPtr& record, bool* denied) override;
     void wasRefused(const CXDChangeRecord& record) override;
+    void willWrite(const CXDChangeRecords& records) override;
     CXDChangeRecords takeMerged() override;
     std::optional<Date> dateOfContact(const CXDChangeRecord& record) override;
     void willGather() override { _gathering = true; }
@@ -130,6 +131,7 @@ private:
     void takeNamesAloneOut(Dictionary prior, const Dictionary& state);
     bool somebodyMayWrite(); // besides the owner
     bool allGroupHas(const char* property);
+    void compareUnlistedGroups(CXDChangeRecords& records);
     void leaveUnlistedOut(CXDChangeRecords& records);
     void forgetSubscribersRights();
     void noteUnsavedAccessLists();

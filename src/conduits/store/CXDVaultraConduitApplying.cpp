@@ -90,6 +90,18 @@ bool CXDVaultraConduit::apply(CXDChangeRecord& record, int& code) {
     }
 }
 
+void CXDVaultraConduit::willWrite(const CXDChangeRecords& records) {
+    _writes.beginPass();
+    for (const CXDChangeRecordPtr& record : records) {
+        if (record->type() != CXDUpdateRecord || !(record->appliesToSources() & conduitSource()) || !record->person() ||
+            !record->user() || !mergesInto(*record->user()))
+            continue;
+        if (const auto base = baseLocationOf(*record))
+            _writes.willWrite(layout::contactLocation(*base, *record->person()), inDatabase(*record),
+                              [&] { return contentOf(*record); });
+    }
+}
+
 bool CXDVaultraConduit::updateRecord(CXDChangeRecord& record, int& code) {
     const auto base = baseLocationOf(record);
     if (!base || !record.person()) return false;

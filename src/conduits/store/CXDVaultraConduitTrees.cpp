@@ -7,6 +7,7 @@
 #include "conduits/store/StoreComparison.h"
 #include "conduits/store/TreeCondition.h"
 #include "contacts/database/CXRolvane.h"
+#include "contacts/database/DamagedDatabase.h"
 #include "contacts/records/Constants.h"
 #include "contacts/records/Identifier.h"
 #include "foundation/Log.h"
@@ -52,7 +53,9 @@ bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state)
         return false;
     }
     const bool isRefused = !engine().conduitObjectForKey(kConduitCX, kRefusedByStore).empty();
-    if (condition.kind == TreeCondition::Kind::lostAGroup && isRefused) return false; // it could not be written yet
+    const bool mayNeverHaveBeenThere =
+        condition.kind == TreeCondition::Kind::lostAGroup || condition.kind == TreeCondition::Kind::lostContacts;
+    if (mayNeverHaveBeenThere && isRefused) return false; // it could not be written yet
     if (condition.mayPass() && !looked)
         prior.set(kLookAgain, true);
     else
@@ -127,10 +130,35 @@ CXDChangeRecords CXDVaultraConduit::changeRecords() {
         _world.preferences.remove(kDaemonDomain, kCXDEndedPublication); // published again since
     _publishesAgain = !engine().conduitObjectForKey(kConduitCX, kPublishAgain).empty();
     leaveUnlistedOut(records);
+    compareUnlistedGroups(records);
     _read.clear();
     records.insert(records.end(), _leftovers.begin(), _leftovers.end());
     _leftovers.clear();
     return records;
+}
+
+// Groups that were deleted, here or there, before the list of everybody named them.
+void CXDVaultraConduit::compareUnlistedGroups(CXDChangeRecords& records) {
+    const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
+    AbsenceCheck absences(_world.rolvane);
+    for (const auto& [user, state] : _read) {
+        const Dictionary prior = users[user.str()].dictionary();
+        const auto isHere = [&, &user = user](const UniqueId& group) {
+            const UniqueId uid = cxUIDWithTableName(group, user == kSelf ? kCXGroupTable : kCXSubscribedGroupTable);
+            if (_world.rolvane.recordForUniqueId(uid)) return true;
+            absences.requireGone(uid);
+            return false;
+        };
+        for (UniqueId& group : unlistedGroupsThatAreGone(prior, state, isHere)) {
+            auto removal =
+                std::make_shared<CXDChangeRecord>(conduitSource(), CXDDeleteGroup, user, std::nullopt, group);
+            removal->setAppliesToSources(CXDSyncSourceCX);
+            records.push_back(std::move(removal));
+        }
+        if (user != kSelf) continue;
+        for (CXDChangeRecordPtr& removal : removalOfUnlistedGroups(prior, state, isHere))
+            records.push_back(std::move(removal));
+    }
 }
 
 // A contact that the list of everybody does not name and that joins no group is about to be added, and comes when it is

@@ -71,6 +71,20 @@ bool isListReplaced(const Array& before, const Array& now, const Dictionary& peo
     });
 }
 
+// Known ones that the list of everybody names neither now nor before. None where single groups are published, and that
+// list names none.
+std::vector<UniqueId> unlistedGroups(const Dictionary& prior, const Dictionary& current) {
+    std::vector<UniqueId> unlisted;
+    const ListedNames listed(current, kSubgroupUIDState), listedBefore(prior, kSubgroupUIDState);
+    if (listed.empty() && listedBefore.empty()) return unlisted;
+    for (const auto& [name, state] : prior) {
+        if (!isGroup(name) || name == kEverybody || state.dictionary().empty()) continue;
+        const UniqueId group(name);
+        if (!listed.contains(group) && !listedBefore.contains(group)) unlisted.push_back(group);
+    }
+    return unlisted;
+}
+
 CXDChangeRecordPtr ownersChange(CXDChangeType type, std::optional<UniqueId> person, std::optional<UniqueId> group,
                                 const Value& payload = {}) {
     auto record =
@@ -140,6 +154,23 @@ CXDChangeRecords removalOfUnlisted(const Dictionary& prior, const Dictionary& cu
     for (const Value& group : difference[kSubgroupRemoves].array())
         if (!current[group.string()].dictionary().empty())
             removals.push_back(ownersChange(CXDDeleteGroup, std::nullopt, UniqueId(group.string())));
+    return removals;
+}
+
+std::vector<UniqueId> unlistedGroupsThatAreGone(const Dictionary& prior, const Dictionary& current,
+                                                const std::function<bool(const UniqueId& name)>& isHere) {
+    std::vector<UniqueId> gone;
+    for (UniqueId& group : unlistedGroups(prior, current))
+        if (current[group.str()].dictionary().empty() && isHere(group)) gone.push_back(std::move(group));
+    return gone;
+}
+
+CXDChangeRecords removalOfUnlistedGroups(const Dictionary& prior, const Dictionary& current,
+                                         const std::function<bool(const UniqueId& name)>& isHere) {
+    CXDChangeRecords removals;
+    for (const UniqueId& group : unlistedGroups(prior, current))
+        if (!current[group.str()].dictionary().empty() && !isHere(group))
+            removals.push_back(ownersChange(CXDDeleteGroup, std::nullopt, group));
     return removals;
 }
 

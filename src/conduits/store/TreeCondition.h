@@ -57,6 +57,16 @@ CXDChangeRecords removalOfLeftovers(const Dictionary& prior, const Dictionary& c
 // longer, and still lies there: another writer has taken it out, and a change that was under way brought its file back.
 CXDChangeRecords removalOfUnlisted(const Dictionary& prior, const Dictionary& current);
 
+// Groups that are known, were named by no list of everybody yet, and whose state is gone: somebody else has deleted
+// them, and no list tells it. Of those that `isHere` knows, which tells of the database.
+std::vector<UniqueId> unlistedGroupsThatAreGone(const Dictionary& prior, const Dictionary& current,
+                                                const std::function<bool(const UniqueId& name)>& isHere);
+
+// The owner's changes that take away known groups which lie there, are named by no list of everybody, and have left the
+// database: no comparison of lists tells of them. `isHere` as above.
+CXDChangeRecords removalOfUnlistedGroups(const Dictionary& prior, const Dictionary& current,
+                                         const std::function<bool(const UniqueId& name)>& isHere);
+
 // The contacts and groups that groups name though neither the list of everybody nor a file does: group -> array of
 // names. Somebody has put them there while somebody else deleted them; or a new one's file is still to come. `isHere`:
 // the owner's database has it; one that the list has lost since `prior` is about to leave it.

@@ -241,6 +241,11 @@ void EngineState::forgetUser(const UserName& user) {
     }
     for (const char* conduit : {kConduitVaultra, kConduitCX})
         conduitObjectForKey(conduit, kPriorState).remove(user.str());
+    Dictionary onTheWay = underWay().mutableCopy();
+    if (onTheWay.contains(user.str())) {
+        onTheWay.remove(user.str());
+        setUnderWay(onTheWay);
+    }
     CXDChangeRecords pending = getPendingChanges();
     if (std::erase_if(pending, [&](const CXDChangeRecordPtr& r) { return r->user() == user; }) > 0)
         setPendingChanges(pending);

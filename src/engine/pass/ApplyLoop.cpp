@@ -142,19 +142,38 @@ void ApplyLoop::applyAll(bool trickle) {
     append(_unhandled, _parts.state.getPendingChanges());
     _queueTaken = true;
     setAside(fresh);
-    _underWay = _parts.state.underWay(); // of a pass that was killed, or what an earlier one left adrift
+    _underWay =
+        underWayInAnyForm(_parts.state.underWay()); // of a pass that was killed, or what an earlier one left adrift
     _unsettled = unsettledGroups(_unhandled, fresh);
     for (const auto& [group, isSo] : unsettledOwnGroups(_unhandled, fresh)) noteUnsure(UniqueId(group));
-    withdrawWhatIsGone(_unhandled, fresh, _parts.with.rolvane);
+    withdrawWhatIsGone(_unhandled, fresh, _parts.with.rolvane, hasCopies());
     dropRemovalsOfWhatIsBack(_unhandled, fresh, _parts.with.rolvane);
-    if (!_underWay->empty())
-        _parts.state.withConduitData(
-            [&](Dictionary& data) { settleUnderWay(*_underWay, _unhandled, data, _parts.with.rolvane); });
+    settleUnderWay();
     queue();
     _parts.with.progress.startedPhase(3);
     split();
     applyOutOfOrder();
     applyInOrder();
+}
+
+void ApplyLoop::settleUnderWay() {
+    for (const SharedTree& tree : treesOf(*_underWay))
+        _parts.state.withConduitData([&](Dictionary& data) {
+            const Dictionary left = rolvane::settleUnderWay(*_underWay, tree, _unhandled, data, _parts.with.rolvane);
+            _end.unread = underWayTogether(_end.unread, left);
+        });
+}
+
+// The own one, and those of others whose subscription is still the one by which the copies came.
+std::vector<SharedTree> ApplyLoop::treesOf(const Dictionary& underWay) const {
+    std::vector<SharedTree> trees;
+    CXRolvane& rolvane = _parts.with.rolvane;
+    const auto isRead = [&](const UserName& user) { return _parts.outcomes.lookAt(user) == TreeLook::read; };
+    if (underWay.contains(kSelf.str())) trees.push_back({kSelf, rolvane.allGroup(), isRead(kSelf)});
+    for (const auto& [user, subscription] : subscriptionsOf(underWay))
+        if (underWay[user.str()].dictionary()[kSubscription] == Value(subscription->uniqueId()))
+            trees.push_back({user, rolvane.allGroupForRemoteLocation(subscription->remoteLocation()), isRead(user)});
+    return trees;
 }
 
 // What waits for the shared folder alone is applied by no pass, and says nothing about what the store holds: news of
@@ -169,7 +188,7 @@ void ApplyLoop::setAside(size_t fresh) {
     if (_setAside.empty()) return;
     const std::unordered_set<CXDChangeRecordPtr, RecordHash, RecordEqual> again(_unhandled.begin(), _unhandled.end());
     std::erase_if(_setAside, [&](const CXDChangeRecordPtr& record) { return again.contains(record); });
-    withdrawWhatIsGone(_setAside, 0, _parts.with.rolvane);
+    withdrawWhatIsGone(_setAside, 0, _parts.with.rolvane, hasCopies());
     dropRemovalsOfWhatIsBack(_setAside, 0, _parts.with.rolvane);
     _setAside = flattenGroupChanges(mingled(_setAside));
     for (const CXDChangeRecordPtr& record : _setAside) record->packPayload();
@@ -214,9 +233,10 @@ void ApplyLoop::split() {
     for (CXDChangeRecordPtr& record : _unhandled)
         (record->canApplyOutOfOrder() ? outOfOrder : _inOrder).push_back(std::move(record));
     _unhandled.clear();
-    const Dictionary now = underWay(outOfOrder);
+    const Dictionary now = withSubscriptions(underWay(outOfOrder));
     _underWay = underWayTogether(*_underWay, now);
     _end.removed = removedBy(outOfOrder);
+    _parts.conduits.vaultra->willWrite(outOfOrder);
     _outOfOrder = std::make_unique<OutOfOrderWork>(_parts, std::move(outOfOrder));
     if (!now.empty()) noteUnderWay();
 }
@@ -224,9 +244,40 @@ void ApplyLoop::split() {
 // What cannot be noted is not done: a later pass would find it on the store, take it for somebody else's, and bring it
 // back over what the owner has changed meanwhile.
 void ApplyLoop::noteUnderWay() {
+    PassCommit commit(_parts.with.rolvane, _parts.with.preferences, _parts.state);
     claimState();
     _parts.state.setUnderWay(*_underWay);
-    _parts.with.preferences.synchronize(kDaemonDomain);
+    _parts.with.rolvane.save();
+    commit.commit();
+}
+
+// Whose contacts the database has: the user's own, and those that a subscription brought, the same since.
+std::function<bool(const UserName&)> ApplyLoop::hasCopies() const {
+    std::unordered_set<UserName> users{kSelf};
+    for (const CXSubscriptionRef& subscription : _parts.with.rolvane.subscriptions()) {
+        const RemoteLocation location = subscription->remoteLocation();
+        const auto user = userForRemoteLocation(location, _parts.with.account.vaultraUser(), _parts.with.loginName);
+        if (user && !_parts.state.isOfFormerSubscription(location, subscription->uniqueId())) users.insert(*user);
+    }
+    return [users = std::move(users)](const UserName& user) { return users.contains(user); };
+}
+
+// By which the trees of others are read now: copies of a former one are gone, and nobody has removed them.
+Dictionary ApplyLoop::withSubscriptions(Dictionary underWay) const {
+    for (const auto& [user, subscription] : subscriptionsOf(underWay))
+        underWay.dictionaryFor(user.str()).set(kSubscription, subscription->uniqueId());
+    return underWay;
+}
+
+std::vector<std::pair<UserName, CXSubscriptionRef>> ApplyLoop::subscriptionsOf(const Dictionary& underWay) const {
+    std::vector<std::pair<UserName, CXSubscriptionRef>> all;
+    if (underWay.empty()) return all;
+    for (const CXSubscriptionRef& subscription : _parts.with.rolvane.subscriptions()) {
+        const auto user = userForRemoteLocation(subscription->remoteLocation(), _parts.with.account.vaultraUser(),
+                                                _parts.with.loginName);
+        if (user && *user != kSelf && underWay.contains(user->str())) all.emplace_back(*user, subscription);
+    }
+    return all;
 }
 
 void ApplyLoop::applyOutOfOrder() {

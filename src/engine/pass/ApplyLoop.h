@@ -13,6 +13,7 @@
 #include <set>
 #include <unordered_set>
 #include <utility>
+#include <vector>
 
 namespace rolvane {
 
@@ -40,6 +41,11 @@ public:
 
 private:
     void applyAll(bool trickle);
+    void settleUnderWay();
+    std::vector<SharedTree> treesOf(const Dictionary& underWay) const;
+    std::function<bool(const UserName&)> hasCopies() const;
+    Dictionary withSubscriptions(Dictionary underWay) const;
+    std::vector<std::pair<UserName, CXSubscriptionRef>> subscriptionsOf(const Dictionary& underWay) const;
     void setAside(size_t fresh); // of the queue, which begins there
     void queue();                // _unhandled becomes the flat list
     CXDChangeRecords accepted();

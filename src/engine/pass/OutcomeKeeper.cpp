@@ -37,6 +37,12 @@ void OutcomeKeeper::treeWasLookedAt(const UserName& user, TreeLook how) {
     _facts.looks[user] = how;
 }
 
+std::optional<TreeLook> OutcomeKeeper::lookAt(const UserName& user) const {
+    const std::lock_guard guard(_lock);
+    const auto look = _facts.looks.find(user);
+    return look == _facts.looks.end() ? std::nullopt : std::optional(look->second);
+}
+
 void OutcomeKeeper::tried(const CXDChangeRecord& record) {
     const std::lock_guard guard(_lock);
     _facts.counts[record.user().value_or(UserName())].toldToSend = true;

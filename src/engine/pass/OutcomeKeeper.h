@@ -28,6 +28,7 @@ public:
 
     void storeWasTested(bool reached, std::optional<PassFailure> why);
     void treeWasLookedAt(const UserName& user, TreeLook how);
+    std::optional<TreeLook> lookAt(const UserName& user) const; // in this pass; none: there was none
     // A record that a source has taken, was asked to take, or was refused for. Any thread.
     void applied(const CXDChangeRecord& record, int32_t source);
     void tried(const CXDChangeRecord& record);

@@ -48,12 +48,13 @@ void withdrawMembers(const CXDChangeRecord& composite, Holdings& holdings, CXDCh
 
 } // namespace
 
-void withdrawWhatIsGone(CXDChangeRecords& records, size_t fresh, CXRolvane& rolvane) {
+void withdrawWhatIsGone(CXDChangeRecords& records, size_t fresh, CXRolvane& rolvane,
+                        const std::function<bool(const UserName& user)>& hasCopies) {
     Holdings holdings(rolvane);
     CXDChangeRecords removals;
     for (size_t i = fresh; i < records.size(); ++i) {
         const CXDChangeRecord& record = *records[i];
-        if (record.initialSource() != CXDSyncSourceCX || !record.changeMadeByDataOwner()) continue;
+        if (record.initialSource() != CXDSyncSourceCX || !record.user() || !hasCopies(*record.user())) continue;
         if (record.type() == CXDUpdateRecord && record.person() && !holdings.person(*record.person()))
             records[i] = removal(record, CXDDeleteRecord, record.person(), std::nullopt);
         else if (putsGroupThere(record) && !holdings.group(*record.group()))

@@ -11,6 +11,7 @@
 
 #include <algorithm>
 #include <array>
+#include <set>
 #include <string_view>
 #include <unordered_map>
 #include <unordered_set>
@@ -21,11 +22,11 @@ namespace {
 
 constexpr const char* kPeople = "people";
 constexpr const char* kGroups = "groups";
-constexpr const char* kNamed = "named";
+constexpr const char* kNames = "names";
 constexpr std::array kLists{kMemberAdds, kMemberRemoves, kSubgroupAdds, kSubgroupRemoves};
 
-Dictionary knownGroups(const Dictionary& conduitData) {
-    return conduitData[kConduitVaultra].dictionary()[kPriorState].dictionary()[kSelf.str()].dictionary();
+Dictionary knownGroups(const Dictionary& conduitData, const UserName& user) {
+    return conduitData[kConduitVaultra].dictionary()[kPriorState].dictionary()[user.str()].dictionary();
 }
 
 std::string shared(const UniqueId& uid, std::string_view table) {
@@ -53,21 +54,34 @@ void noteGroup(Dictionary& group, const CXDChangeRecord& record) {
     const Dictionary payload = content.isDictionary() ? content.dictionary() : Dictionary();
     for (const char* list : kLists)
         if (payload.contains(list)) addEach(group.arrayFor(list), payload[list]);
-    if (record.type() == CXDChangeGroupName || payload.contains(kCXGroupNameProperty)) group.set(kNamed, true);
+    const Value& name = record.type() == CXDChangeGroupName ? content : payload[kCXGroupNameProperty];
+    if (name.isString()) addEach(group.arrayFor(kNames), Array{name});
     const char* list = listOf(record.type());
     if (!list || !record.person()) return;
     const bool isGroup = list == kSubgroupAdds || list == kSubgroupRemoves;
     group.arrayFor(list).append(shared(*record.person(), isGroup ? kCXGroupTable : kCXPersonTable));
 }
 
-// Makes the records of one pass's beginning.
+bool isWrite(const CXDChangeRecord& record) {
+    return record.initialSource() == CXDSyncSourceCX && record.user() &&
+           (record.appliesToSources() & CXDSyncSourceVaultra) != 0;
+}
+
+// Makes the records of one pass's beginning, for one tree.
 class Settlement {
 public:
-    Settlement(const CXDChangeRecords& records, Dictionary& conduitData, CXRolvane& rolvane)
-        : _conduitData(conduitData), _known(knownGroups(conduitData)), _rolvane(rolvane), _holdings(rolvane) {
-        for (const CXDChangeRecordPtr& record : records)
-            if (record->group() && isOwnWrite(*record)) _gathered.insert(shared(*record->group(), kCXGroupTable));
-        _withdrawn = removedBy(records);
+    Settlement(const CXDChangeRecords& records, const SharedTree& tree, Dictionary& conduitData, CXRolvane& rolvane)
+        : _tree(tree), _conduitData(conduitData), _known(knownGroups(conduitData, tree.user)), _rolvane(rolvane),
+          _holdings(rolvane) {
+        for (const CXDChangeRecordPtr& record : records) {
+            if (record->user() != _tree.user) continue;
+            if (record->group() && isWrite(*record)) _gathered.insert(shared(*record->group(), kCXGroupTable));
+            if (record->group() && record->initialSource() == CXDSyncSourceVaultra &&
+                record->type() == CXDChangeGroupName)
+                _namesThere[shared(*record->group(), kCXGroupTable)] = record->inMemoryPayload();
+            if (record->type() == CXDDeleteGroup && record->group() && isWrite(*record))
+                _withdrawn.insert(cxUIDWithTableName(*record->group(), kCXGroupTable));
+        }
     }
 
     void person(const UniqueId& uid) {
@@ -78,37 +92,46 @@ public:
         _gone.insert(uid.str());
     }
 
-    void group(const UniqueId& uid, const Dictionary& touched) {
-        if (_withdrawn.contains(uid)) return; // and a change beside that would be folded with it into one that is none
+    // Gives what of it cannot be settled before the tree is read.
+    Dictionary group(const UniqueId& uid, const Dictionary& touched) {
+        Dictionary left;
+        if (_withdrawn.contains(uid)) return left; // and a change beside that would be folded into one that is none
         const bool isAll = uid.str() == kCXAllGroupUID;
-        const CXGroupRef there =
-            isAll ? _rolvane.allGroup() : std::dynamic_pointer_cast<CXGroup>(_rolvane.recordForUniqueId(uid));
         if (!_holdings.group(uid)) {
             add(CXDDeleteGroup, std::nullopt, uid);
             _gone.insert(uid.str());
-            return;
+            return left;
         }
-        if (!there) return; // a copy of somebody else's
+        const CXGroupRef there =
+            isAll ? _tree.everybody : std::dynamic_pointer_cast<CXGroup>(_rolvane.recordForUniqueId(inDatabase(uid)));
+        if (!there) return left; // of another tree
         const bool isKnown = _known.contains(uid.str());
-        if (!isKnown && !_gathered.contains(uid.str())) return;
+        if (!isKnown && !_gathered.contains(uid.str())) return left;
         const Dictionary known = _known[uid.str()].dictionary();
-        std::unordered_set<std::string>& decided = _decided[uid.str()];
-        for (const char* list : kLists)
-            for (const Value& name : touched[list].array()) decided.insert(name.string());
         set(uid, touched, known[kMemberUIDState], there->memberUniqueIds(),
             {kMemberAdds, kMemberRemoves, CXDAddRecordToGroup, CXDRemoveRecordFromGroup, kCXPersonTable});
         set(uid, touched, known[kSubgroupUIDState], there->subgroupUniqueIds(),
             {kSubgroupAdds, kSubgroupRemoves, CXDAddGroupToGroup, CXDRemoveGroupFromGroup, kCXGroupTable});
-        if (!touched[kNamed].boolean()) return;
+        if (isAll || !touched.contains(kNames)) return left;
+        if (!_tree.isRead) {
+            left.set(kNames, touched[kNames]);
+            return left;
+        }
+        // Another name than those comes from somebody else.
+        const auto name = _namesThere.find(uid.str());
+        if (name == _namesThere.end() || name->second == Value(there->name()) ||
+            !touched[kNames].array().contains(name->second))
+            return left;
         _renamed.insert(uid.str());
-        if (isKnown && !isAll) add(CXDChangeGroupName, std::nullopt, uid, Value(there->name()));
+        add(CXDChangeGroupName, std::nullopt, uid, Value(there->name()));
+        return left;
     }
 
     CXDChangeRecords take() { return std::move(_records); }
 
     // Would it bring back, or take away, from the store what the database decides?
     bool isOverruled(const CXDChangeRecord& record) const {
-        if (record.initialSource() != CXDSyncSourceVaultra || !record.changeMadeByDataOwner()) return false;
+        if (record.initialSource() != CXDSyncSourceVaultra || record.user() != _tree.user) return false;
         const bool isSubgroup = record.type() == CXDAddGroupToGroup || record.type() == CXDRemoveGroupFromGroup;
         const std::string person =
             record.person() ? shared(*record.person(), isSubgroup ? kCXGroupTable : kCXPersonTable) : std::string();
@@ -118,7 +141,7 @@ public:
         if (_gone.contains(group)) return true;
         if (record.type() == CXDChangeGroupName) return _renamed.contains(group);
         const auto decided = _decided.find(group);
-        return decided != _decided.end() && decided->second.contains(person);
+        return decided != _decided.end() && decided->second.contains({record.type(), person});
     }
 
 private:
@@ -127,6 +150,9 @@ private:
         CXDChangeType add, remove;
         std::string_view table;
     };
+    UniqueId inDatabase(const UniqueId& group) const {
+        return _tree.user == kSelf ? group : cxUIDWithTableName(group, kCXSubscribedGroupTable);
+    }
     // What is known and not there, or there and not known, is a matter of the scan, which brings the contents along.
     void set(const UniqueId& group, const Dictionary& touched, const Value& known, const std::vector<UniqueId>& now,
              const Kind& kind) {
@@ -134,39 +160,46 @@ private:
         std::unordered_set<std::string> there;
         for (const UniqueId& uid : now) there.insert(shared(uid, kind.table));
         const Array members = known.array();
-        for (const Value& name : touched[kind.adds].array())
+        auto& decided = _decided[group.str()];
+        for (const Value& name : touched[kind.adds].array()) {
+            decided.emplace(kind.add, name.string());
             if (!there.contains(name.string()) && !members.containsString(name.string()))
                 add(kind.remove, UniqueId(name.string()), group);
-        for (const Value& name : touched[kind.removes].array())
-            if (there.contains(name.string()) && members.containsString(name.string())) {
-                const UniqueId uid(name.string());
-                const CXDChangeRecord removal(CXDSyncSourceCX, kind.remove, kSelf, uid, group);
-                didApplyChange(_conduitData, removal, CXDSyncSourceVaultra); // that may have come to its end
-                add(kind.add, uid, group);
-            }
+        }
+        for (const Value& name : touched[kind.removes].array()) {
+            decided.emplace(kind.remove, name.string());
+            if (!there.contains(name.string()) || !members.containsString(name.string())) continue;
+            const UniqueId uid(name.string());
+            const CXDChangeRecord removal(CXDSyncSourceCX, kind.remove, _tree.user, uid, group);
+            didApplyChange(_conduitData, removal, CXDSyncSourceVaultra); // that may have come to its end
+            add(kind.add, uid, group);
+        }
     }
 
     void add(CXDChangeType type, const std::optional<UniqueId>& person, const std::optional<UniqueId>& group,
              const Value& payload = {}) {
-        auto record = std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, type, kSelf, person, group, payload);
+        auto record = std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, type, _tree.user, person, group, payload);
         record->setAppliesToSources(CXDSyncSourceVaultra);
         _records.push_back(std::move(record));
     }
 
+    const SharedTree& _tree;
     Dictionary& _conduitData;
     const Dictionary _known; // by group
     CXRolvane& _rolvane;
     Holdings _holdings;
     std::unordered_set<std::string> _gathered, _gone, _renamed;
     std::unordered_set<UniqueId> _withdrawn;
-    std::unordered_map<std::string, std::unordered_set<std::string>> _decided; // by group, its members and subgroups
+    std::unordered_map<std::string, Value> _namesThere; // that the store has and that are not known, by group
+    // By group: the changes of members and subgroups that the pass was to make.
+    std::unordered_map<std::string, std::set<std::pair<int32_t, std::string>>> _decided;
     CXDChangeRecords _records;
 };
 
 // Who and what is not in both lists of all that are known.
-void addUnlisted(Dictionary& left, const Dictionary& underWay, const Dictionary& conduitData,
+void addUnlisted(Dictionary& left, const Dictionary& own, const Dictionary& conduitData,
                  const std::unordered_set<UniqueId>& removed) {
-    const Dictionary touchedGroups = underWay[kGroups].dictionary();
+    const Dictionary touchedGroups = own[kGroups].dictionary();
     if (removed.contains(UniqueId(kCXAllGroupUID))) return;
     std::array<Dictionary, 2> lists;
     bool listed = true;
@@ -181,7 +214,7 @@ void addUnlisted(Dictionary& left, const Dictionary& underWay, const Dictionary&
             return !all[list].array().containsString(name);
         });
     };
-    for (const Value& person : underWay[kPeople].array())
+    for (const Value& person : own[kPeople].array())
         if (isAdrift(person.string(), kMemberUIDState)) left.arrayFor(kPeople).append(person);
     for (const auto& [group, touched] : touchedGroups)
         if (group == kCXAllGroupUID ? !listed : isAdrift(group, kSubgroupUIDState))
@@ -198,11 +231,13 @@ bool isOwnWrite(const CXDChangeRecord& record) {
 Dictionary underWay(const CXDChangeRecords& records) {
     Dictionary all;
     for (const CXDChangeRecordPtr& record : records) {
-        if (!isOwnWrite(*record)) continue;
+        if (!isWrite(*record)) continue;
         if (record->type() == CXDUpdateRecord && record->person()) {
-            all.arrayFor(kPeople).append(shared(*record->person(), kCXPersonTable));
+            all.dictionaryFor(record->user()->str())
+                .arrayFor(kPeople)
+                .append(shared(*record->person(), kCXPersonTable));
         } else if (record->group() && *record->group() != kPeopleGroup && record->type() != CXDDeleteGroup) {
-            Dictionary groups = all.dictionaryFor(kGroups);
+            Dictionary groups = all.dictionaryFor(record->user()->str()).dictionaryFor(kGroups);
             Dictionary group = groups.dictionaryFor(shared(*record->group(), kCXGroupTable));
             noteGroup(group, *record);
         }
@@ -210,14 +245,25 @@ Dictionary underWay(const CXDChangeRecords& records) {
     return all;
 }
 
+Dictionary underWayInAnyForm(const Dictionary& stored) {
+    const Dictionary groups = stored[kGroups].dictionary();
+    const bool isOfOneUser = stored[kPeople].isArray() ||
+                             std::any_of(groups.begin(), groups.end(),
+                                         [](const auto& group) { return group.first.ends_with(kCXGroupTable); });
+    return isOfOneUser ? Dictionary{{kSelf.str(), stored}} : stored;
+}
+
 Dictionary underWayTogether(const Dictionary& former, const Dictionary& latter) {
     Dictionary both = Value(former).deepMutableCopy().dictionary();
-    if (latter.contains(kPeople)) addEach(both.arrayFor(kPeople), latter[kPeople]);
-    for (const auto& [uid, touched] : latter[kGroups].dictionary()) {
-        Dictionary group = both.dictionaryFor(kGroups).dictionaryFor(uid);
-        for (const char* list : kLists)
-            if (touched.dictionary().contains(list)) addEach(group.arrayFor(list), touched.dictionary()[list]);
-        if (touched.dictionary()[kNamed].boolean()) group.set(kNamed, true);
+    for (const auto& [user, of] : latter) {
+        Dictionary tree = both.dictionaryFor(user);
+        const Dictionary& added = of.dictionary();
+        if (added.contains(kSubscription)) tree.set(kSubscription, added[kSubscription]);
+        if (added.contains(kPeople)) addEach(tree.arrayFor(kPeople), added[kPeople]);
+        for (const auto& [uid, touched] : added[kGroups].dictionary()) {
+            Dictionary group = tree.dictionaryFor(kGroups).dictionaryFor(uid);
+            for (const auto& [list, elements] : touched.dictionary()) addEach(group.arrayFor(list), elements);
+        }
     }
     return both;
 }
@@ -249,22 +295,29 @@ std::unordered_set<UniqueId> groupsOf(const CXDChangeRecords& ownWrites) {
 }
 
 Dictionary adrift(const Dictionary& underWay, const Dictionary& conduitData, const PassEnd& end) {
+    const Dictionary own = underWay[kSelf.str()].dictionary();
     Dictionary left;
-    for (const auto& [group, touched] : underWay[kGroups].dictionary())
+    for (const auto& [group, touched] : own[kGroups].dictionary())
         if (end.unsureGroups.contains(UniqueId(group)) && !end.removed.contains(UniqueId(group)))
             left.dictionaryFor(kGroups).set(group, touched);
-    if (end.everythingIsPublished) addUnlisted(left, underWay, conduitData, end.removed);
-    return left;
+    if (end.everythingIsPublished) addUnlisted(left, own, conduitData, end.removed);
+    return left.empty() ? end.unread : underWayTogether(end.unread, Dictionary{{kSelf.str(), left}});
 }
 
-void settleUnderWay(const Dictionary& underWay, CXDChangeRecords& records, Dictionary& conduitData,
-                    CXRolvane& rolvane) {
-    Settlement settlement(records, conduitData, rolvane);
-    for (const Value& person : underWay[kPeople].array()) settlement.person(UniqueId(person.string()));
-    for (const auto& [group, touched] : underWay[kGroups].dictionary())
-        settlement.group(UniqueId(group), touched.dictionary());
+Dictionary settleUnderWay(const Dictionary& underWay, const SharedTree& tree, CXDChangeRecords& records,
+                          Dictionary& conduitData, CXRolvane& rolvane) {
+    Settlement settlement(records, tree, conduitData, rolvane);
+    const Dictionary of = underWay[tree.user.str()].dictionary();
+    Dictionary left;
+    for (const Value& person : of[kPeople].array()) settlement.person(UniqueId(person.string()));
+    for (const auto& [group, touched] : of[kGroups].dictionary())
+        if (const Dictionary rest = settlement.group(UniqueId(group), touched.dictionary()); !rest.empty())
+            left.dictionaryFor(tree.user.str()).dictionaryFor(kGroups).set(group, rest);
+    if (!left.empty() && of.contains(kSubscription))
+        left.dictionaryFor(tree.user.str()).set(kSubscription, of[kSubscription]);
     std::erase_if(records, [&](const CXDChangeRecordPtr& record) { return settlement.isOverruled(*record); });
     for (CXDChangeRecordPtr& record : settlement.take()) records.push_back(std::move(record));
+    return left;
 }
 
 } // namespace rolvane

@@ -1,5 +1,6 @@
 #pragma once
 
+#include "contacts/records/CXGroup.h"
 #include "foundation/Value.h"
 #include "model/CXDChangeRecord.h"
 
@@ -10,29 +11,40 @@ namespace rolvane {
 
 class CXRolvane;
 
-// What a pass is about to put on the network store of the owner's own: people, and groups with those members and
-// subgroups that are put in or taken out, or whose name is set. Nothing but the end of the pass would remember it. It
-// is put down before the workers begin; when the pass is killed and the person undoes such a change before the next
+// What a pass is about to put on the network store, by the user whose tree it is: people, and groups with those members
+// and subgroups that are put in or taken out, and their new names. Nothing but the end of the pass would remember it.
+// It is put down before the workers begin; when the pass is killed and the person undoes such a change before the next
 // one, no comparison of what is known with what is there finds anything, or one finds the pass's own write, takes it
 // for somebody else's and brings it back.
 
-// {"people": array, "groups": {group: {"memberAdds": array, "memberRemoves", "subgroupAdds", "subgroupRemoves":
-// likewise, "named": true}}}; empty when there is nothing to remember.
+// {user: {"people": array, "subscription": text, "groups": {group: {"memberAdds": array, "memberRemoves",
+// "subgroupAdds", "subgroupRemoves", "names": likewise}}}}; empty when there is nothing to remember.
 Dictionary underWay(const CXDChangeRecords& records);
+inline constexpr const char* kSubscription = "subscription"; // to the tree of somebody else; set by the caller
+// A note of an earlier version knew the own tree alone, and had no user in it.
+Dictionary underWayInAnyForm(const Dictionary& stored);
 // Both together; neither is changed.
 Dictionary underWayTogether(const Dictionary& former, const Dictionary& latter);
 
-// What was under way when a pass was killed is made what the database says: whoever or whatever is gone is removed from
-// the store, members are put in or taken out, names are set. The records for it are added to `records`, which is what
-// the pass has gathered and the queue; and those are taken out by which the store would bring the same back. Of groups
-// only those are spoken of that are shared still, which is to say that they are known or gathered.
-void settleUnderWay(const Dictionary& underWay, CXDChangeRecords& records, Dictionary& conduitData, CXRolvane& rolvane);
+struct SharedTree {
+    UserName user;
+    CXGroupRef everybody; // the database's all-contacts group for it
+    bool isRead = false;  // the records say all in which the tree differs from what is known
+};
+// What was under way in one tree when a pass was killed is made what the database says: whoever or whatever is gone is
+// removed from the store, members are put in or taken out, names are set that the pass may have written. The records
+// for it are added to `records`, which is what the pass has gathered and the queue; and those are taken out by which
+// the store would bring the same back. Of groups only those are spoken of that are shared still, which is to say that
+// they are known or gathered. Gives what of it cannot be settled before the tree is read.
+Dictionary settleUnderWay(const Dictionary& underWay, const SharedTree& tree, CXDChangeRecords& records,
+                          Dictionary& conduitData, CXRolvane& rolvane);
 
 // What is known at the end of a pass, identifiers in their shared form.
 struct PassEnd {
     std::unordered_set<UniqueId> removed;      // people and groups that it took from the store, or has still to take
     std::unordered_set<UniqueId> unsureGroups; // whose changes wait, or may have been lost
     bool everythingIsPublished = false;        // and not single groups only
+    Dictionary unread;                         // under way in trees that were not read
 };
 std::unordered_set<UniqueId> removedBy(const CXDChangeRecords& records);
 bool isOwnWrite(const CXDChangeRecord& record); // of the owner's, to the network store

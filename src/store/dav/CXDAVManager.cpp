@@ -203,6 +203,10 @@ CXDAVManager::Version CXDAVManager::readVersion(const Url& url, bool securely, i
     return {std::move(reading.dictionary), reading.isKnown, reading.lastModified, reading.failed};
 }
 
+void CXDAVManager::expectAbsence(const Url& url, bool securely) {
+    _impl->files.expectAbsence(url, securely);
+}
+
 bool CXDAVManager::remembersVersion(const Url& url) const {
     return _impl->versions.remembers(url.absoluteString());
 }

@@ -102,6 +102,9 @@ public:
     };
     Version readVersion(const Url& url, bool securely, int* code);
     bool remembersVersion(const Url& url) const; // some version of the file, read or written at any time
+    // The next write of this thread, if it is to this file, is refused with 412 where something else lies there already
+    // (RFC 9110 section 13.1.2). Sends nothing.
+    void expectAbsence(const Url& url, bool securely);
     std::optional<Dictionary> dictionaryAtURL(const Url& url, int* errorCode, bool securely) override;
     bool removeFileAtURL(const Url& url, int* code); // a file or a collection with its contents; absence: 404, true
     bool removeDirectoryAndContentsAtURL(const Url& url) override;

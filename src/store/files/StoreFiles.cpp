@@ -287,6 +287,11 @@ StoreFiles::Reading StoreFiles::read(const Url& name, bool securely) {
     return {fetched.code, std::move(fetched.dictionary), isKnown, fetched.version.lastModified, failed};
 }
 
+void StoreFiles::expectAbsence(const Url& name, bool securely) {
+    if (const auto url = _session.endpoint(name, securely))
+        lastReads[_reader] = {name, *url, true, ReadMark::State::absent, {}};
+}
+
 void StoreFiles::expectReads(const std::vector<Url>& names, bool securely) {
     std::vector<Url> urls;
     urls.reserve(names.size());

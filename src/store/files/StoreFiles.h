@@ -34,6 +34,8 @@ public:
         bool failed = false;              // what is there, or whether anything is, was not learnt
     };
     Reading read(const Url& name, bool securely);
+    // The next write of this thread, if it is to that file, is refused where something lies there. Sends nothing.
+    void expectAbsence(const Url& name, bool securely);
     // These are going to be read, in this order (see ReadAhead).
     void expectReads(const std::vector<Url>& names, bool securely);
     // These are, too, in an order that is told later (see EarlyReads).

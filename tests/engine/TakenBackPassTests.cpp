@@ -1,0 +1,211 @@
+// Passes whose writes have reached the store and not the disk, as when the daemon is killed before it can put down what
+// it did. Meanwhile either user goes on editing.
+
+#include "TwoUsers.h"
+#include "Writes.h"
+#include "foundation/CXException.h"
+
+namespace rolvane::test {
+
+class TakenBackPass : public TwoUsers {
+protected:
+    TakenBackPass() {
+        for (int i = 0; i < 2; ++i) {
+            bob.pass();
+            alice.pass();
+        }
+    }
+    ~TakenBackPass() override { interceptWrites(nullptr); }
+
+    // From its first write to the store on nothing reaches the disk; then a new daemon.
+    void passThatIsTakenBack(Participant& user) {
+        ends = false;
+        user.wire->intercept([](const HttpRequest& request) {
+            if (request.method == "PUT" && !request.url.encodedPath().ends_with("dateFile")) ends = true;
+            return std::optional<HttpResponse>();
+        });
+        interceptWrites([] { return !ends.load(); });
+        try {
+            user.pass();
+        } catch (const CXException&) { // so it ends
+        }
+        interceptWrites(nullptr);
+        EXPECT_TRUE(ends) << "nothing was written\n" << log.text();
+        user.wire->intercept({});
+        user.start();
+    }
+    void settle() {
+        for (Participant* each : {&alice, &bob, &alice, &bob, &alice, &bob}) each->pass();
+        EXPECT_EQ(copies(), alice.view()) << log.text();
+        for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
+    }
+    // Bob makes it in Alice's tree.
+    CXPersonRef addToAlices(const std::string& first) {
+        const auto person =
+            CXPerson::initWithUniqueId(cxUIDWithTableName(CXPerson::create()->uniqueId(), kCXSubscribedPersonTable));
+        place(*person);
+        bob.application->addRecord(person);
+        person->setValue(Value(first), kCXFirstNameProperty);
+        bob.application->save();
+        return person;
+    }
+    CXGroupRef groupInAlices(const std::string& name) {
+        const auto group =
+            CXGroup::initWithUniqueId(cxUIDWithTableName(CXGroup::create()->uniqueId(), kCXSubscribedGroupTable));
+        place(*group);
+        bob.application->addRecord(group);
+        group->setValue(Value(name), kCXGroupNameProperty);
+        bob.application->save();
+        return group;
+    }
+    void place(CXRecord& record) {
+        CXMutableMultiValue location;
+        location.addValue(alice.base, kCXSubscribeLabel);
+        record.setValue(location, kCXRemoteLocationProperty);
+    }
+    void rename(Participant& user, const CXRecordRef& group, const char* name) {
+        group->setValue(Value(name), kCXGroupNameProperty);
+        user.application->save();
+    }
+    void remove(Participant& user, const CXRecordRef& record) {
+        user.application->removeRecord(record);
+        user.application->save();
+    }
+    CXRecordRef copyOf(const CXRecordRef& record, std::string_view table) {
+        return bob.application->recordForUniqueId(cxUIDWithTableName(record->uniqueId(), table));
+    }
+    bool isOnTheStore(const UniqueId& person) { return std::filesystem::exists(fileOf(cxNormalizedUID(person))); }
+
+    static inline std::atomic<bool> ends = false;
+};
+
+TEST_F(TakenBackPass, AContactThatAWriterDeletesBehindItStaysDeleted) {
+    const CXPersonRef dora = addToAlices("Dora");
+    passThatIsTakenBack(bob);
+    ASSERT_TRUE(isOnTheStore(dora->uniqueId())) << log.text();
+    remove(bob, dora);
+    settle();
+    EXPECT_FALSE(isOnTheStore(dora->uniqueId()));
+    EXPECT_EQ(alice.countPeople(), 3u);
+}
+
+TEST_F(TakenBackPass, AContactThatItsOwnerDeletesBehindItStaysDeleted) {
+    const CXPersonRef dora = alice.add("Dora");
+    passThatIsTakenBack(alice);
+    ASSERT_TRUE(isOnTheStore(dora->uniqueId())) << log.text();
+    remove(alice, dora);
+    settle();
+    EXPECT_FALSE(isOnTheStore(dora->uniqueId()));
+    EXPECT_EQ(bob.countPeople(alice.base), 3u);
+}
+
+// Nobody remembers that the store has the new contact, and somebody else has edited it there since.
+TEST_F(TakenBackPass, AnEditOfTheNewContactByTheOtherUserIsKept) {
+    for (Participant* maker : {&alice, &bob}) {
+        SCOPED_TRACE(maker->name);
+        const CXPersonRef made = maker == &alice ? alice.add("Dora") : addToAlices("Emil");
+        passThatIsTakenBack(*maker);
+        const std::filesystem::path file = fileOf(cxNormalizedUID(made->uniqueId()));
+        ASSERT_TRUE(std::filesystem::exists(file)) << log.text();
+        Dictionary content = contentOf(file).mutableCopy();
+        content.set(kCXFirstNameProperty, "Elsewhere");
+        content.set(kCXOrganizationProperty, "Company");
+        rewrite(file, PropertyList::toXML(content));
+        made->setValue(Value("A note"), kCXNoteProperty);
+        maker->application->save();
+        settle();
+        EXPECT_EQ(firstName(made), Value("Elsewhere")) << log.text();
+        EXPECT_EQ(made->valueForProperty(kCXOrganizationProperty), Value("Company"));
+        EXPECT_EQ(made->valueForProperty(kCXNoteProperty), Value("A note"));
+    }
+}
+
+TEST_F(TakenBackPass, ANumberThatIsReplacedBehindItDoesNotStandBesideItsSuccessor) {
+    const CXPersonRef dora = alice.add("Dora", "11");
+    passThatIsTakenBack(alice);
+    CXMutableMultiValue phones;
+    phones.addValue("22", "work");
+    dora->setValue(phones, kCXPhoneProperty);
+    alice.application->save();
+    settle();
+    const auto after = dora->multiValueForProperty(kCXPhoneProperty);
+    ASSERT_TRUE(after);
+    ASSERT_EQ(after->count(), 1u) << log.text();
+    EXPECT_EQ(after->valueAtIndex(0), Value("22"));
+}
+
+TEST_F(TakenBackPass, ANameThatTheOwnerTakesBackIsTakenFromTheStore) {
+    rename(alice, friends, "Renamed");
+    passThatIsTakenBack(alice);
+    rename(alice, friends, "Friends");
+    settle();
+    EXPECT_EQ(friends->name(), "Friends") << log.text();
+}
+
+TEST_F(TakenBackPass, ANameThatSomebodyElseGivesBehindItStays) {
+    rename(alice, friends, "Renamed");
+    passThatIsTakenBack(alice);
+    rename(alice, friends, "Friends");
+    bob.pass();
+    rename(bob, copyOf(friends, kCXSubscribedGroupTable), "Bob's");
+    bob.pass();
+    settle();
+    EXPECT_EQ(friends->name(), "Bob's") << log.text();
+}
+
+// Its absence in a database with another subscription is nobody's doing.
+TEST_F(TakenBackPass, WhatANewSubscriptionHasNotBroughtYetIsNotDeleted) {
+    const CXPersonRef dora = addToAlices("Dora");
+    passThatIsTakenBack(bob);
+    for (const CXSubscriptionRef& subscription : bob.application->subscriptions())
+        if (subscription->remoteLocation() == RemoteLocation(alice.base)) bob.application->removeRecord(subscription);
+    bob.application->save();
+    bob.subscribe(alice);
+    settle();
+    EXPECT_EQ(alice.countPeople(), 4u) << log.text();
+    EXPECT_TRUE(isOnTheStore(dora->uniqueId()));
+}
+
+// Nothing of it has ever been on the store, and no comparison knows that it was to come.
+TEST_F(TakenBackPass, WhatAWriterMakesAndDeletesWhileTheStoreIsAwayNeverComes) {
+    bob.network.reachable = false;
+    const CXPersonRef dora = addToAlices("Dora");
+    const CXGroupRef circle = groupInAlices("Circle");
+    circle->addMember(dora);
+    bob.application->save();
+    bob.pass();
+    EXPECT_FALSE(bob.engine->getPendingChanges().empty());
+    remove(bob, circle);
+    remove(bob, dora);
+    bob.start();
+    bob.network.reachable = true;
+    settle();
+    EXPECT_EQ(alice.countPeople(), 3u) << log.text();
+    EXPECT_FALSE(isOnTheStore(dora->uniqueId()));
+    EXPECT_FALSE(std::filesystem::exists(world->file(cxNormalizedUID(circle->uniqueId()).str())));
+}
+
+// The writer's new group came without its place in the list, which waits; the owner takes it in and deletes it.
+TEST_F(TakenBackPass, AGroupThatIsDeletedBeforeItsMakerHasListedItIsNotListedAnyMore) {
+    const CXGroupRef circle = groupInAlices("Circle");
+    std::atomic<bool> fails = true;
+    bob.wire->intercept([&](const HttpRequest& request) {
+        const bool isList =
+            request.method == "PUT" && request.url.encodedPath().find("/AllCXGroup") != std::string::npos;
+        return fails && isList ? std::optional(answerOf(503)) : std::nullopt;
+    });
+    bob.pass();
+    const UniqueId shared = cxNormalizedUID(circle->uniqueId());
+    ASSERT_TRUE(std::filesystem::exists(world->file(shared.str()))) << log.text();
+    alice.pass();
+    const CXRecordRef hers = alice.application->recordForUniqueId(shared);
+    ASSERT_TRUE(hers) << log.text();
+    remove(alice, hers);
+    alice.pass();
+    fails = false;
+    settle();
+    EXPECT_FALSE(alice.application->recordForUniqueId(shared));
+    EXPECT_FALSE(std::filesystem::exists(world->file(shared.str())));
+}
+
+} // namespace rolvane::test
