@@ -53,6 +53,21 @@ protected:
     std::string status(const std::string& device, const std::string& password) {
         return ask(device, password, "books/", {"-X", "PROPFIND", "-H", "Depth: 0"}).substr(0, 3);
     }
+    // Of one request with each of the passwords, one after the other.
+    std::string statuses(const std::string& device, const std::vector<std::string>& passwords) {
+        const Json told = Json::parse(world.rolvane({"books", "status", "--json"}).output);
+        std::vector<std::string> command = {"curl", "-q"};
+        for (const std::string& password : passwords) {
+            if (command.size() > 2) command.emplace_back("--next");
+            for (const std::string& word :
+                 {std::string("-sS"), std::string("--noproxy"), std::string("*"), std::string("--cacert"),
+                  told["caFile"].get<std::string>(), std::string("-o"), std::string("/dev/null"), std::string("-w"),
+                  std::string("%{http_code}\\n"), std::string("-X"), std::string("PROPFIND"), std::string("-u"),
+                  device + ":" + password, told["url"].get<std::string>() + "books/"})
+                command.push_back(word);
+        }
+        return world.run(command).output;
+    }
     std::string addDevice(const std::string& name) { return json({"books", "device", "add", name})["password"]; }
 
     UserWorld world;
@@ -163,8 +178,18 @@ TEST_F(BooksCommand, GuessesArePutOffAndADeviceThatIsInStaysIn) {
     done({"books", "on"});
     const std::string laptop = addDevice("laptop"), phone = addDevice("phone");
     ASSERT_EQ(status("laptop", laptop), "207");
-    for (int i = 0; i < 8; ++i) EXPECT_EQ(status("phone", "guess" + std::to_string(i)), "401");
-    EXPECT_EQ(status("phone", phone), "401") << "in a pause the right one is not looked at either";
+    // The right one right behind the guesses, by one process. Where that was held up longer than the first pause lasts,
+    // the device got in, and it begins anew.
+    constexpr int kGuesses = 8, kRounds = 30;
+    std::vector<std::string> passwords;
+    for (int i = 0; i < kGuesses; ++i) passwords.push_back("guess" + std::to_string(i));
+    passwords.push_back(phone);
+    std::string codes;
+    for (int round = 0; round < kRounds && !codes.ends_with("401\n"); ++round) {
+        codes = statuses("phone", passwords);
+        EXPECT_THAT(codes, testing::StartsWith("401\n401\n401\n401\n401\n401\n401\n401\n"));
+    }
+    EXPECT_THAT(codes, testing::EndsWith("401\n")) << "in a pause the right one is not looked at either";
     EXPECT_EQ(status("laptop", laptop), "207");
 }
 
