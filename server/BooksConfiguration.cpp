@@ -71,6 +71,10 @@ std::string booksModulePath(const std::string& httpdModules) {
 std::string renderBooksConfiguration(const BooksOptions& options, int port, int inner, bool withIPv6) {
     for (const auto& path : {options.stateDirectory, options.database, options.httpdModules})
         refuseUnsafePath(kService, path);
+    const std::string tls = options.stateDirectory + "/tls/server";
+    const bool isOwn = !options.certificate.empty();
+    for (const auto& path : {options.certificate, options.key})
+        if (isOwn) refuseUnsafePath(kService, path);
     refuseUnsafeWord(kService, "log level", options.logLevel);
     std::string text;
     if (options.tls) text += "Define TLS\n";
@@ -79,6 +83,8 @@ std::string renderBooksConfiguration(const BooksOptions& options, int port, int 
     return text + filledIn(readFile(httpdTemplatePath("books.conf.in")),
                            {{"STATE", options.stateDirectory},
                             {"DATABASE", options.database},
+                            {"CERTIFICATE", isOwn ? options.certificate : tls + ".pem"},
+                            {"KEY", isOwn ? options.key : tls + ".key"},
                             {"MODULES", options.httpdModules},
                             {"DAVACL", moduleOr("", storeAccessModulePath(options.httpdModules), "mod_davacl.so")},
                             {"CARDBOOK", moduleOr(options.cardbookModule, booksModulePath(options.httpdModules),
@@ -129,6 +135,8 @@ Dictionary booksOptionsToDictionary(const BooksOptions& options, int port, int i
     d.set("tls", options.tls);
     d.set("listen", options.listen);
     d.set("hosts", hosts);
+    d.set("certificate", options.certificate);
+    d.set("key", options.key);
     d.set("threads", options.threads);
     d.set("maximumCard", options.maximumCard);
     d.set("maximumReport", options.maximumReport);
@@ -150,6 +158,8 @@ BooksOptions booksOptionsFromDictionary(const Dictionary& d) {
     options.tls = d["tls"].boolean(options.tls);
     options.listen = d["listen"].string();
     options.hosts = texts(d["hosts"].array());
+    options.certificate = d["certificate"].string();
+    options.key = d["key"].string();
     options.threads = static_cast<int>(d["threads"].integer(options.threads));
     options.maximumCard = d["maximumCard"].integer(options.maximumCard);
     options.maximumReport = d["maximumReport"].integer(options.maximumReport);

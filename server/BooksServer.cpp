@@ -100,6 +100,8 @@ std::vector<std::string> placesOfUser() {
 
 BooksServer::BooksServer(BooksOptions options) : _options(std::move(options)) {
     _options.stateDirectory = orDefault(_options.stateDirectory);
+    for (std::string* file : {&_options.certificate, &_options.key})
+        if (!file->empty()) *file = HttpdLauncher::withoutLinks(*file);
     if (!_options.database.empty()) _options.database = HttpdLauncher::withoutLinks(_options.database);
 }
 
@@ -147,6 +149,13 @@ void BooksServer::checkOptions() const {
     if (!exists(_options.database))
         fail("There is no contact database at " + _options.database +
              ". Make it with `rolvane import FILE` or `rolvane add`, then switch the address books on.");
+    if (!_options.certificate.empty() || !_options.key.empty()) {
+        const std::string wrong = certificateProblem(_options.certificate, _options.key);
+        if (!wrong.empty())
+            fail(wrong +
+                 " Give --certificate and --key as PEM files that belong together, the certificate with the ones "
+                 "that sign it behind it; or --made-certificate for one that this machine makes.");
+    }
     if (_options.listen.empty()) return;
     if (!isAddress(_options.listen))
         fail("\"" + _options.listen +
@@ -184,7 +193,7 @@ std::vector<std::string> BooksServer::certificateHosts() const {
 
 void BooksServer::writeConfiguration(int port, int inner) const {
     StoreCertificates certificates(_options.stateDirectory + "/tls");
-    if (_options.tls) certificates.ensure(certificateHosts(), kCertificateLifetime);
+    if (_options.tls && _options.certificate.empty()) certificates.ensure(certificateHosts(), kCertificateLifetime);
     const std::string passwords = _options.stateDirectory + "/conf/passwords";
     if (!exists(passwords)) writeFileDurably(passwords, "");
     writeFileDurably(launcher().configurationFile(),
@@ -266,11 +275,14 @@ BooksStatus BooksServer::status() const {
 }
 
 std::string BooksServer::caFile() const {
+    if (!_options.certificate.empty()) return {};
     return StoreCertificates(_options.stateDirectory + "/tls").caFile();
 }
 
 std::string BooksServer::fingerprint() const {
-    return _options.tls ? StoreCertificates(_options.stateDirectory + "/tls").fingerprint() : "";
+    if (!_options.tls) return {};
+    if (!_options.certificate.empty()) return fingerprintOfCertificate(_options.certificate);
+    return StoreCertificates(_options.stateDirectory + "/tls").fingerprint();
 }
 
 std::string BooksServer::url() const {

@@ -17,6 +17,7 @@ struct BooksOptions {
     bool tls = true;
     std::string listen;               // an address of this machine beside the loopback ones; "" = none
     std::vector<std::string> hosts;   // names and addresses in the certificate beside localhost and `listen`
+    std::string certificate, key;     // PEM files of the owner's own; "" = made by this machine. Both or none
     int threads = 24;                 // requests at once
     int64_t maximumCard = 10485760;   // bytes
     int64_t maximumReport = 16777216; // bytes of a REPORT's body
@@ -65,7 +66,7 @@ public:
 
     std::string stateDirectory() const { return _options.stateDirectory; }
     std::string errorLog() const { return launcher().errorLog(); }
-    std::string caFile() const;
+    std::string caFile() const;      // "" where the certificate is the owner's own
     std::string fingerprint() const; // of the certificate; "" without TLS
     // "https://localhost:PORT/", and the same with the host that other machines use; throw before the first start.
     std::string url() const;

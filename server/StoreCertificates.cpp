@@ -152,7 +152,20 @@ bool StoreCertificates::ensure(const std::vector<std::string>& hosts, std::chron
 }
 
 std::string StoreCertificates::fingerprint() const {
-    const Certificate certificate = readCertificate(certificateFile());
+    return fingerprintOfCertificate(certificateFile());
+}
+
+std::string certificateProblem(const std::string& certificate, const std::string& key) {
+    const Certificate read = readCertificate(certificate);
+    if (!read) return "\"" + certificate + "\" holds no certificate that can be read.";
+    if (!keyFits(key, read.get())) return "\"" + key + "\" holds no key of that certificate.";
+    if (X509_cmp_current_time(X509_get0_notAfter(read.get())) <= 0)
+        return "The time of the certificate in \"" + certificate + "\" is over.";
+    return {};
+}
+
+std::string fingerprintOfCertificate(const std::string& file) {
+    const Certificate certificate = readCertificate(file);
     unsigned char digest[EVP_MAX_MD_SIZE];
     unsigned int size = 0;
     if (!certificate || X509_digest(certificate.get(), EVP_sha256(), digest, &size) != 1) return {};

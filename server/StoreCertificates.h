@@ -35,4 +35,10 @@ private:
     mode_t _keyMode;
 };
 
+// SHA-256 of the first certificate in a PEM file, "AB:CD:..."; "" when there is none.
+std::string fingerprintOfCertificate(const std::string& file);
+
+// Why a server cannot use these two PEM files, as a sentence; "" when it can.
+std::string certificateProblem(const std::string& certificate, const std::string& key);
+
 } // namespace rolvane

@@ -18,10 +18,10 @@ namespace {
 using Json = nlohmann::ordered_json;
 
 struct ServerOptions {
-    std::string directory, listen, device;
+    std::string directory, listen, certificate, key, device;
     std::vector<std::string> hosts;
     int port = 0;
-    bool tls = true, loopback = false, accessLog = false, qr = false, renew = false;
+    bool tls = true, loopback = false, madeCertificate = false, accessLog = false, qr = false, renew = false;
 };
 
 std::string dateText(const BooksDevice& device) {
@@ -48,7 +48,7 @@ Json serverJson(const BooksServer& server, const BooksOptions& options) {
             {"port", status.port ? Json(status.port) : Json()},
             {"url", status.port ? Json(server.url()) : Json()},
             {"outsideURL", status.port ? ifKnown(server.outsideURL()) : Json()},
-            {"caFile", options.tls && status.port ? Json(server.caFile()) : Json()},
+            {"caFile", options.tls && status.port ? ifKnown(server.caFile()) : Json()},
             {"fingerprint", ifKnown(server.fingerprint())},
             {"database", ifKnown(options.database)},
             {"errorLog", server.errorLog()},
@@ -97,6 +97,11 @@ void switchOn(Context& context, CLI::App& command, const ServerOptions& options)
     }
     if (given("--listen")) chosen.listen = options.listen;
     if (given("--host")) chosen.hosts = options.hosts;
+    if (given("--made-certificate")) chosen.certificate = chosen.key = "";
+    if (given("--certificate")) {
+        chosen.certificate = options.certificate;
+        chosen.key = options.key;
+    }
     if (given("--port")) chosen.port = options.port;
     if (given("--tls")) chosen.tls = options.tls;
     if (given("--access-log")) chosen.accessLog = options.accessLog;
@@ -227,6 +232,13 @@ void addBooksCommands(CLI::App& app, Context& context) {
                                         "An address of this machine for your network, or 0.0.0.0 for all; needs TLS");
             c.add_flag("--loopback", o->loopback, "This machine alone, which is so at first")->excludes(listen);
             c.add_option("--host", o->hosts, "Another name or address in the certificate (may be given again)");
+            auto* certificate = c.add_option("--certificate", o->certificate,
+                                             "A certificate of your own (PEM, with those that sign it); needs --key");
+            auto* key = c.add_option("--key", o->key, "Its key (PEM)")->needs(certificate);
+            certificate->needs(key);
+            c.add_flag("--made-certificate", o->madeCertificate,
+                       "The one that this machine makes, which is so at first")
+                ->excludes(certificate);
             c.add_option("--port", o->port, "Port; the one of the last time, else a free one")
                 ->check(CLI::Range(1, 65535));
             c.add_flag("--tls,!--no-tls", o->tls, "With TLS, which is so at first, or plain http on this machine");

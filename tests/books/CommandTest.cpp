@@ -338,6 +338,40 @@ TEST_F(BooksOfAnOrdinaryUser, AreReachedAtTheAddressThatWasAskedFor) {
     EXPECT_TRUE(Json::parse(back.output)["outsideURL"].is_null()) << back;
 }
 
+TEST_F(BooksOfAnOrdinaryUser, ShowACertificateOfOnesOwn) {
+    const std::string directory = world.home.path();
+    const auto make = [&](const std::string& name) {
+        const Ran made = run({"openssl", "req", "-x509", "-newkey", "rsa:2048", "-nodes", "-days", "2", "-subj",
+                              "/CN=localhost", "-addext", "subjectAltName=DNS:localhost,IP:127.0.0.2", "-keyout",
+                              directory + "/" + name + ".key", "-out", directory + "/" + name + ".pem"});
+        ASSERT_EQ(made.status, 0) << made;
+    };
+    make("mine");
+    make("other");
+    const std::string mine = directory + "/mine.pem";
+    const Ran wrong =
+        user({"books", "on", "--listen", "127.0.0.2", "--certificate", mine, "--key", directory + "/other.key"});
+    EXPECT_EQ(wrong.status, 1) << wrong;
+    EXPECT_THAT(wrong.errors, HasSubstr("other.key\" holds no key of that certificate"));
+    EXPECT_EQ(user({"books", "on", "--certificate", mine}).status, 2) << "without its key";
+    const Ran ran = user(
+        {"books", "on", "--listen", "127.0.0.2", "--certificate", mine, "--key", directory + "/mine.key", "--json"});
+    ASSERT_EQ(ran.status, 0) << ran;
+    Json on = Json::parse(ran.output);
+    EXPECT_TRUE(on["caFile"].is_null());
+    const Ran shown = run({"openssl", "x509", "-in", mine, "-noout", "-fingerprint", "-sha256"});
+    EXPECT_THAT(shown.output, HasSubstr(on["fingerprint"].get<std::string>()));
+    const Json phone = Json::parse(user({"books", "device", "add", "phone", "--json"}).output);
+    on["caFile"] = mine;
+    EXPECT_EQ(codeOf(on["outsideURL"], on, phone["password"]), "207");
+    EXPECT_EQ(codeOf(on["url"], on, phone["password"]), "207");
+    const Json again = Json::parse(user({"books", "on", "--json"}).output);
+    EXPECT_EQ(again["fingerprint"], on["fingerprint"]) << "it is kept";
+    const Json made = Json::parse(user({"books", "on", "--made-certificate", "--json"}).output);
+    EXPECT_NE(made["fingerprint"], on["fingerprint"]);
+    EXPECT_EQ(codeOf(made["outsideURL"], made, phone["password"]), "207");
+}
+
 TEST_F(BooksOfAnOrdinaryUser, AServiceManagerKeepsThePortAndHandsConnectionsOn) {
     ASSERT_EQ(symlink(ROLVANE_SOURCE_DIR "/tests/books/service-manager", (world.home / "systemctl").c_str()), 0);
     world.home.setVariable("PATH", world.home.path() + ":" + std::getenv("PATH"));
