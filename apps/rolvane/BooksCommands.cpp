@@ -235,7 +235,8 @@ void addBooksCommands(CLI::App& app, Context& context) {
             auto* certificate = c.add_option("--certificate", o->certificate,
                                              "A certificate of your own (PEM, with those that sign it); needs --key");
             auto* key = c.add_option("--key", o->key, "Its key (PEM)")->needs(certificate);
-            certificate->needs(key);
+            certificate->needs(key)->type_name(kFileValue);
+            key->type_name(kFileValue);
             c.add_flag("--made-certificate", o->madeCertificate,
                        "The one that this machine makes, which is so at first")
                 ->excludes(certificate);
