@@ -80,6 +80,7 @@ bench:
 	bench/longlist.py build/bench
 	bench/signin.py build/bench
 	bench/naming.py build/bench
+	bench/subscribers.py build/bench
 
 lint:
 	@packaging/setup build test lint

@@ -4,6 +4,7 @@
 #include "server/mod_davacl/XmlElements.h"
 
 #include <algorithm>
+#include <iterator>
 
 namespace rolvane::davacl {
 namespace {
@@ -22,7 +23,21 @@ std::optional<Unmet> checkProtected(const AclPlace& place, const apr_xml_elem* a
     return std::nullopt;
 }
 
+const apr_xml_elem* principalOf(const apr_xml_elem* ace) {
+    const apr_xml_elem* inverted = child(ace, "invert");
+    return child(inverted ? inverted : ace, "principal");
+}
+
+// RFC 3744 section 5.5.1.
+bool isOfAKnownKind(const apr_xml_elem* principal) {
+    constexpr const char* kKinds[] = {"href", "all", "authenticated", "unauthenticated", "property", "self"};
+    return std::any_of(std::begin(kKinds), std::end(kKinds),
+                       [&](const char* kind) { return child(principal, kind) != nullptr; });
+}
+
 std::optional<Unmet> checkInherited(const AclPlace& place, const apr_xml_elem* ace) {
+    if (!isOfAKnownKind(principalOf(ace)))
+        return Unmet{"allowed-principal", "The principal of an inherited entry is of no known kind."};
     const apr_xml_elem* href = child(child(ace, "inherited"), "href");
     if (href && std::find(place.above.begin(), place.above.end(), textOf(href)) != place.above.end())
         return std::nullopt;
@@ -73,7 +88,7 @@ std::optional<Unmet> readPrivileges(const apr_xml_elem* grant, Grant& into) {
 // RFC 3744 section 5.5: one principal, who is one, and either grants or denials.
 bool isWellFormed(const apr_xml_elem* ace) {
     const size_t principals = countOf(ace, "principal") + countOf(ace, "invert");
-    const apr_xml_elem* principal = child(child(ace, "invert") ? child(ace, "invert") : ace, "principal");
+    const apr_xml_elem* principal = principalOf(ace);
     if (principals != 1 || elementsIn(principal) != 1 || !textOf(principal).empty() ||
         countOf(ace, "grant") + countOf(ace, "deny") != 1)
         return false;

@@ -1,15 +1,13 @@
 #include "server/mod_davacl/Newcomers.h"
 
 #include "server/mod_davacl/Configuration.h"
+#include "server/mod_davacl/NewcomerBound.h"
 
 #include <apr_portable.h>
 #include <chrono>
 #include <condition_variable>
 #include <csignal>
 #include <fcntl.h>
-#include <list>
-#include <map>
-#include <memory>
 #include <mutex>
 #include <netinet/in.h>
 #include <string>
@@ -23,7 +21,6 @@ namespace {
 
 using Clock = std::chrono::steady_clock;
 constexpr auto kPace = std::chrono::seconds(1);
-constexpr auto kSilent = std::chrono::seconds(1); // a client that is busy may be as slow as this
 
 std::string addressOf(const conn_rec* c) {
     const apr_sockaddr_t* address = c->client_addr;
@@ -45,18 +42,18 @@ public:
         const std::lock_guard lock(_mutex);
         const auto [found, isNew] = _all.try_emplace(c);
         if (!isNew) {
-            found->second.heard = Clock::now();
+            found->second.seen.heard = Clock::now();
             return;
         }
         const int copy = fcntl(socket, F_DUPFD_CLOEXEC, 0);
-        if (copy >= 0) found->second = {addressOf(c), copy, most, false, Clock::now()};
+        if (copy >= 0) found->second = {{addressOf(c), most, false, Clock::now()}, copy};
     }
     void setBusy(const conn_rec* c, bool busy) {
         const std::lock_guard lock(_mutex);
         const auto found = _all.find(c);
         if (found == _all.end()) return;
-        found->second.busy = busy;
-        found->second.heard = Clock::now();
+        found->second.seen.busy = busy;
+        found->second.seen.heard = Clock::now();
     }
     bool knows(const conn_rec* c) {
         const std::lock_guard lock(_mutex);
@@ -74,35 +71,38 @@ public:
         release(found->second);
         _all.erase(found);
     }
-    void closeSurplus() {
+    void closeSurplus(const server_rec* server) {
         const std::lock_guard lock(_mutex);
-        std::map<std::string, std::multimap<Clock::time_point, One*>> silent;
-        std::map<std::string, size_t> held;
-        const auto now = Clock::now();
+        std::vector<Newcomer> counted;
+        std::vector<One*> ones;
         for (auto& [c, one] : _all) {
             if (one.socket < 0) continue;
-            ++held[one.address];
-            if (!one.busy && now - one.heard >= kSilent) silent[one.address].emplace(one.heard, &one);
+            counted.push_back(one.seen);
+            ones.push_back(&one);
         }
-        for (auto& [address, all] : silent)
-            for (auto& [heard, one] : all) {
-                if (held[address] <= one->most) break;
-                char byte = 0;
-                if (recv(one->socket, &byte, 1, MSG_PEEK | MSG_DONTWAIT) > 0) continue; // it waits for us
-                shutdown(one->socket, SHUT_RDWR);                                       // httpd finds its end
-                release(*one);
-                --held[address];
-            }
+        if (surplusOf(counted, Clock::now()).empty()) return; // as nearly always: nobody's socket is asked
+        for (size_t i = 0; i < ones.size(); ++i) counted[i].busy = counted[i].busy || waitsForUs(*ones[i]);
+        const auto surplus = surplusOf(counted, Clock::now());
+        for (const size_t i : surplus) {
+            shutdown(ones[i]->socket, SHUT_RDWR); // httpd finds its end
+            release(*ones[i]);
+        }
+        if (!surplus.empty())
+            ap_log_error(APLOG_MARK, APLOG_INFO, 0, server,
+                         "davacl: %d of %d connections without a sign-in were closed: they said nothing, and their "
+                         "address has more than DavAclNewcomers",
+                         static_cast<int>(surplus.size()), static_cast<int>(counted.size()));
     }
 
 private:
     struct One {
-        std::string address;
+        Newcomer seen;
         int socket = -1; // none: it does not count
-        size_t most = 0;
-        bool busy = false;
-        Clock::time_point heard = {};
     };
+    static bool waitsForUs(const One& one) {
+        char byte = 0;
+        return recv(one.socket, &byte, 1, MSG_PEEK | MSG_DONTWAIT) > 0;
+    }
     static void release(One& one) {
         if (one.socket >= 0) close(one.socket);
         one.socket = -1;
@@ -129,7 +129,7 @@ const conn_rec* connectionOf(const request_rec* r) {
 
 class Watch {
 public:
-    Watch() {
+    explicit Watch(const server_rec* server) : _server(server) {
         sigset_t all, before;
         sigfillset(&all);
         pthread_sigmask(SIG_SETMASK, &all, &before); // signals are the other threads'
@@ -150,8 +150,9 @@ public:
 private:
     void serve() {
         std::unique_lock lock(_mutex);
-        while (!_end.wait_for(lock, kPace, [this] { return _ended; })) newcomers().closeSurplus();
+        while (!_end.wait_for(lock, kPace, [this] { return _ended; })) newcomers().closeSurplus(_server);
     }
+    const server_rec* const _server;
     std::mutex _mutex;
     std::condition_variable _end;
     bool _ended = false; // guarded by _mutex
@@ -199,7 +200,7 @@ void watchNewcomers(apr_pool_t* pool, server_rec* server) noexcept {
     for (const server_rec* each = server; each; each = each->next) wanted = wanted || mostNewcomers(each) > 0;
     if (!wanted) return;
     try {
-        apr_pool_cleanup_register(pool, new Watch, endWatch, apr_pool_cleanup_null);
+        apr_pool_cleanup_register(pool, new Watch(server), endWatch, apr_pool_cleanup_null);
     } catch (const std::exception& e) {
         ap_log_error(APLOG_MARK, APLOG_ERR, 0, server, "davacl: newcomers are not watched: %s", e.what());
     }

@@ -111,6 +111,12 @@ void ControlServer::serve() {
     }
 }
 
+bool ControlServer::hasRoomFor(pid_t process) const {
+    const auto ofIt = std::count_if(_peers.begin(), _peers.end(),
+                                    [process](const auto& entry) { return entry.second.process == process; });
+    return _peers.size() < kMostPeers && static_cast<size_t>(ofIt) < kMostOfOneProcess;
+}
+
 bool ControlServer::accept() {
     for (int turn = 0; turn < kBacklogATurn; ++turn) {
         OwnedDescriptor socket(::accept4(_listening.get(), nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK));
@@ -119,9 +125,12 @@ bool ControlServer::accept() {
             return errno != EMFILE && errno != ENFILE;
         }
         const std::lock_guard guard(_mutex);
-        if (_peers.size() >= kMostPeers || !isOfThisUser(socket.get())) continue;
+        const pid_t process = processOf(socket.get());
+        if (!isOfThisUser(socket.get()) || !hasRoomFor(process)) continue;
         const int fd = socket.get();
-        _peers[fd].socket = std::move(socket);
+        Peer& peer = _peers[fd];
+        peer.socket = std::move(socket);
+        peer.process = process;
     }
     return true;
 }

@@ -7,6 +7,7 @@
 #include <map>
 #include <mutex>
 #include <set>
+#include <sys/types.h>
 #include <thread>
 
 namespace rolvane {
@@ -15,13 +16,14 @@ namespace rolvane {
 // observe. A thread of its own answers, so a command learns within a moment that the daemon lives, however long the
 // main thread is busy with a pass.
 //
-// Bounds: at most kMostPeers at a time, the next ones are let go at once; a peer that does not read loses progress
-// first (names that `mayBeDropped`), and the connection when more than kMostWaiting bytes wait for it. A peer that does
-// nothing but send is read kMostATurn bytes at a time, and the others have their turns in between. Who observes more
-// than kMostNames names is let go.
+// Bounds: at most kMostPeers at a time and kMostOfOneProcess of one process, the next ones are let go at once; a peer
+// that does not read loses progress first (names that `mayBeDropped`), and the connection when more than kMostWaiting
+// bytes wait for it. A peer that does nothing but send is read kMostATurn bytes at a time, and the others have their
+// turns in between. Who observes more than kMostNames names is let go.
 class ControlServer {
 public:
     static constexpr size_t kMostPeers = 128;
+    static constexpr size_t kMostOfOneProcess = 32; // so that one that loses count leaves room for the others
     static constexpr size_t kMostWaiting = size_t{4} << 20;
     static constexpr size_t kDropsFrom = size_t{256} << 10;
     static constexpr size_t kMostATurn = size_t{64} << 10;
@@ -46,6 +48,7 @@ public:
 private:
     struct Peer {
         OwnedDescriptor socket;
+        pid_t process = 0; // that connected
         ControlReader reader;
         std::set<std::string> observed;
         std::string waiting; // bytes that its socket did not take yet
@@ -53,6 +56,7 @@ private:
     };
     void serve();
     bool accept(); // false when no descriptor is left for another peer
+    bool hasRoomFor(pid_t process) const;
     void read(Peer& peer);
     void answer(Peer& peer, const ControlMessage& message);
     static void write(Peer& peer, const std::string& bytes);

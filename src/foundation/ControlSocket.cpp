@@ -93,6 +93,12 @@ OwnedDescriptor connectToPath(const std::string& path) {
     return fd;
 }
 
+pid_t processOf(int socket) {
+    ucred peer{};
+    socklen_t size = sizeof peer;
+    return ::getsockopt(socket, SOL_SOCKET, SO_PEERCRED, &peer, &size) == 0 ? peer.pid : 0;
+}
+
 bool isOfThisUser(int socket) {
     ucred peer{};
     socklen_t size = sizeof peer;

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <string>
+#include <sys/types.h>
 #include <utility>
 
 namespace rolvane {
@@ -29,5 +30,6 @@ OwnedDescriptor listenAtPath(const std::string& path);
 // None when nobody listens there, or somebody else than this user.
 OwnedDescriptor connectToPath(const std::string& path);
 bool isOfThisUser(int socket); // its peer
+pid_t processOf(int socket);   // its peer that connected; 0 when the kernel does not say
 
 } // namespace rolvane

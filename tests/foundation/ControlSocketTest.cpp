@@ -13,6 +13,7 @@
 #include <random>
 #include <thread>
 
+#include <poll.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -416,6 +417,41 @@ TEST_F(Ends, APeerThatNeverCeasesToSendKeepsNobodyElseWaiting) {
         loop, [&] { return sent.load(); }, "the flood"));
     for (int i = 0; i < 5; ++i) ASSERT_TRUE(answered(command->postForAnswer({"Ask", {}, {{"n", i}}})));
     EXPECT_TRUE(hears(5));
+}
+
+// Another program of the same person asks.
+TEST_F(Ends, AProgramThatTakesEveryPlaceLeavesRoomForTheOthers) {
+    start();
+    std::vector<OwnedDescriptor> held(ControlServer::kMostPeers);
+    for (OwnedDescriptor& each : held) // the server takes them when it comes to it
+        ASSERT_TRUE(waitUntil(
+            loop,
+            [&] {
+                each = connectToPath(path);
+                return static_cast<bool>(each);
+            },
+            "a place in the line"));
+    char byte = 0;
+    const auto isLetGo = [&](const OwnedDescriptor& each) {
+        return ::recv(each.get(), &byte, 1, MSG_DONTWAIT) == 0 || errno == ECONNRESET;
+    };
+    ASSERT_TRUE(waitUntil(
+        loop, [&] { return isLetGo(held.back()); }, "the last one to be let go"));
+    const pid_t other = ::fork();
+    if (other == 0) {
+        const OwnedDescriptor socket = connectToPath(path);
+        ControlMessage ask = postOf("Ask");
+        ask.number = 1;
+        const std::string frame = ask.frame();
+        if (!socket || ::send(socket.get(), frame.data(), frame.size(), MSG_NOSIGNAL) < 0) std::_Exit(2);
+        pollfd answer = {socket.get(), POLLIN, 0};
+        (void)!::poll(&answer, 1, -1);
+        std::_Exit(::recv(socket.get(), &byte, 1, 0) > 0 ? 0 : 3);
+    }
+    int status = -1;
+    ASSERT_EQ(::waitpid(other, &status, 0), other);
+    EXPECT_EQ(WEXITSTATUS(status), 0);
+    EXPECT_FALSE(isLetGo(held.front())) << "the first ones stay";
 }
 
 TEST_F(Ends, APeerThatObservesTooManyNamesIsLetGo) {

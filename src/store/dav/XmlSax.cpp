@@ -1,5 +1,7 @@
 #include "store/dav/XmlSax.h"
 
+#include "foundation/Utf8.h"
+
 #include <algorithm>
 #include <new>
 
@@ -103,6 +105,7 @@ void XmlSax::onStart(void* self, const xmlChar* local, const xmlChar* prefix, co
     std::string name = reinterpret_cast<const char*>(local);
     // A name with a prefix that nobody declared, or with half of one, belongs nowhere.
     if ((prefix && !uri) || name.find(':') != std::string::npos) return sax->refuse();
+    if (!sax->_begun.empty() || !isUtf8(name) || !isUtf8(space)) return sax->refuse();
     if (space != "DAV:") name = "{" + plainURI(space) + "}" + name;
     sax->_path.push_back(std::move(name));
     if (sax->_path.size() > sax->_maxDepth || !sax->opened(sax->_path)) sax->refuse();
@@ -111,14 +114,28 @@ void XmlSax::onStart(void* self, const xmlChar* local, const xmlChar* prefix, co
 void XmlSax::onEnd(void* self, const xmlChar*, const xmlChar*, const xmlChar*) {
     auto* sax = static_cast<XmlSax*>(self);
     if (!sax->_good || sax->_path.empty()) return;
-    if (!sax->closed(sax->_path)) sax->refuse();
+    if (!sax->_begun.empty() || !sax->closed(sax->_path)) sax->refuse();
     sax->_path.pop_back();
 }
 
 void XmlSax::onText(void* self, const xmlChar* characters, int length) {
     auto* sax = static_cast<XmlSax*>(self);
     if (!sax->_good) return;
-    if (!sax->text({reinterpret_cast<const char*>(characters), static_cast<size_t>(length)})) sax->refuse();
+    const std::string_view piece(reinterpret_cast<const char*>(characters), static_cast<size_t>(length));
+    if (!sax->isText(piece) || !sax->text(piece)) sax->refuse();
+}
+
+// The parser lets overlong forms through, which other readers take for other characters. A character may come in two
+// pieces.
+bool XmlSax::isText(std::string_view piece) {
+    if (_begun.empty() && isUtf8(piece)) return true;
+    const std::string whole = _begun + std::string(piece);
+    std::string_view rest = whole;
+    while (takeCodePoint(rest)) {
+    }
+    constexpr size_t kLongest = 4; // bytes of a character
+    _begun = rest;
+    return _begun.size() < kLongest;
 }
 
 void XmlSax::onReference(void* self, const xmlChar*) {

@@ -7,9 +7,9 @@
 
 namespace rolvane {
 
-// A namespace-aware push parser over libxml2's SAX2 interface. A declaration within a document type, a
-// reference to an entity that XML does not define, depth over the limit or a false from a handler ends it. Base of the
-// readers of WebDAV bodies; one thread.
+// A namespace-aware push parser over libxml2's SAX2 interface. A declaration within a document type, text that is not
+// UTF-8 (RFC 3629) once it was decoded, a reference to an entity that XML does not define, depth over the limit or a
+// false from a handler ends it. Base of the readers of WebDAV bodies; one thread.
 class XmlSax {
 public:
     explicit XmlSax(int maxDepth);
@@ -38,10 +38,12 @@ private:
     static void onNotation(void* self, const xmlChar*, const xmlChar*, const xmlChar*);
     static void onUnparsed(void* self, const xmlChar*, const xmlChar*, const xmlChar*, const xmlChar*);
     void refuse();
+    bool isText(std::string_view piece);
 
     xmlSAXHandler _handler{};
     xmlParserCtxtPtr _context = nullptr;
     std::vector<std::string> _path;
+    std::string _begun; // the bytes of a character of which more has to come
     const size_t _maxDepth;
     bool _good = true;
 };

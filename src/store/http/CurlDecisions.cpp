@@ -48,6 +48,9 @@ bool wantsDigest(const HttpResponse& answer) {
 
 bool needsNewConnection(const CurlSlot& slot, CURLcode code) {
     const HttpJob& job = *slot.job();
+    // The server ended the connection before there was one, so it has not seen a byte of the request.
+    if (code == CURLE_SSL_CONNECT_ERROR && job.tries == 0 && job.verdict == TransportError::none)
+        return !job.metNoHandshake;
     if (job.onNewConnection || job.verdict != TransportError::none || !mayBeSentTwice(job.request.method)) return false;
     const bool ended = job.metDead || code == CURLE_GOT_NOTHING || code == CURLE_SEND_ERROR ||
                        code == CURLE_RECV_ERROR || code == CURLE_HTTP2 || code == CURLE_HTTP2_STREAM ||

@@ -11,7 +11,8 @@ namespace rolvane {
 
 // The one place where libcurl's codes become ours.
 TransportError translated(CURLcode code);
-// Whether a kept connection has failed the job of the slot, so that a new one may serve it.
+// Whether a new connection may serve the job of the slot: a kept one has failed it, or the TLS handshake of a new one
+// did, for the first time. The latter is safe for every method.
 bool needsNewConnection(const CurlSlot& slot, CURLcode code);
 // Why a transfer that ended with the code failed, for a person.
 std::string reason(CURLcode code, const HttpJob& job);

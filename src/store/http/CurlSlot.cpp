@@ -17,6 +17,7 @@ void HttpJob::forgetAnswer() {
     headerDone = false;
     headerBytes = bodyBytes = 0;
     tries = 0;
+    inHandshake = false;
     metDead = false;
     verdict = TransportError::none;
     verdictDetail.clear();
@@ -31,6 +32,8 @@ namespace {
 
 // Of bytes that nobody acknowledges: longer than lost packets take on a poor line, shorter than anybody likes to wait.
 constexpr unsigned kDeadMilliseconds = 10000;
+
+constexpr long kSlackMilliseconds = 1000;
 
 bool isLoopbackAddress(const char* text) {
     in_addr v4;
@@ -66,6 +69,8 @@ CurlSlot::CurlSlot(const CurlTransportOptions& options) : _easy(curl_easy_init()
     curl_easy_setopt(_easy, CURLOPT_OPENSOCKETFUNCTION, &CurlSlot::onOpen);
     curl_easy_setopt(_easy, CURLOPT_PREREQFUNCTION, &CurlSlot::onConnected);
     curl_easy_setopt(_easy, CURLOPT_PREREQDATA, this);
+    curl_easy_setopt(_easy, CURLOPT_SSL_CTX_FUNCTION, &CurlSlot::onHandshake);
+    curl_easy_setopt(_easy, CURLOPT_SSL_CTX_DATA, this);
     curl_easy_setopt(_easy, CURLOPT_NOSIGNAL, 1L);
     curl_easy_setopt(_easy, CURLOPT_NOPROGRESS, 1L);
     curl_easy_setopt(_easy, CURLOPT_FOLLOWLOCATION, 0L);
@@ -75,7 +80,6 @@ CurlSlot::CurlSlot(const CurlTransportOptions& options) : _easy(curl_easy_init()
     curl_easy_setopt(_easy, CURLOPT_ACCEPT_ENCODING, "");
     curl_easy_setopt(_easy, CURLOPT_TCP_NODELAY, 1L);
     curl_easy_setopt(_easy, CURLOPT_TCP_KEEPALIVE, 1L);
-    curl_easy_setopt(_easy, CURLOPT_CONNECTTIMEOUT_MS, 15000L);
     curl_easy_setopt(_easy, CURLOPT_QUICK_EXIT, 1L);
     curl_easy_setopt(_easy, CURLOPT_USERAGENT, options.userAgent.c_str());
     curl_easy_setopt(_easy, CURLOPT_SSL_VERIFYPEER, 1L);
@@ -98,6 +102,9 @@ void CurlSlot::prepare(std::unique_ptr<HttpJob> job, const Setting& setting) {
     _job->forgetAnswer();
     curl_easy_setopt(_easy, CURLOPT_URL, _job->request.url.absoluteString().c_str());
     curl_easy_setopt(_easy, CURLOPT_MAXFILESIZE_LARGE, static_cast<curl_off_t>(_job->request.limits.maxBodyBytes));
+    // The job's own limits say when to give up, isIdle for a connection that does not come.
+    curl_easy_setopt(_easy, CURLOPT_CONNECTTIMEOUT_MS,
+                     static_cast<long>(_job->request.limits.totalSeconds * 1000) + kSlackMilliseconds);
     setMethod();
     setHeaders();
     setCredentials(setting.digest);
@@ -193,6 +200,7 @@ void CurlSlot::setProxy() {
 
 bool CurlSlot::isIdle(SteadyTime now) {
     curl_off_t sent = 0;
+    if (_job->tries == 0 && _job->inHandshake) _lastMove = now;
     curl_easy_getinfo(_easy, CURLINFO_SIZE_UPLOAD_T, &sent);
     const uint64_t moved = static_cast<uint64_t>(sent) + _job->headerBytes + _job->bodyBytes;
     if (moved != _bytesMoved) {
@@ -223,6 +231,12 @@ curl_socket_t CurlSlot::onOpen(void*, curlsocktype, curl_sockaddr* address) {
     const int made = ::socket(address->family, address->socktype | SOCK_CLOEXEC, address->protocol);
     if (made >= 0) ::setsockopt(made, IPPROTO_TCP, TCP_USER_TIMEOUT, &kDeadMilliseconds, sizeof kDeadMilliseconds);
     return made;
+}
+
+// The server has taken the connection.
+CURLcode CurlSlot::onHandshake(CURL*, void*, void* self) {
+    static_cast<CurlSlot*>(self)->_job->inHandshake = true;
+    return CURLE_OK;
 }
 
 // Plain http leaves only towards this machine, whatever the name in the URL resolved to. And libcurl, which repeats a

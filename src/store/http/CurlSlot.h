@@ -23,11 +23,13 @@ struct HttpJob {
     int repetitions = 0;
     bool http1Only = false;
     bool onNewConnection = false; // a kept one has failed it
+    bool metNoHandshake = false;  // the TLS handshake of a new one has failed, once
 
     HttpResponse response;
-    bool headerDone = false; // of the final answer
-    int tries = 0;           // libcurl repeats a request by itself when a kept connection turns out to be dead
-    bool metDead = false;    // and has met the second one
+    bool headerDone = false;  // of the final answer
+    bool inHandshake = false; // a TLS handshake has begun, and is not over while `tries` is 0
+    int tries = 0;            // libcurl repeats a request by itself when a kept connection turns out to be dead
+    bool metDead = false;     // and has met the second one
     size_t headerBytes = 0, bodyBytes = 0;
     TransportError verdict = TransportError::none; // why the transfer was ended from our side
     std::string verdictDetail;
@@ -56,7 +58,8 @@ public:
     void prepare(std::unique_ptr<HttpJob> job, const Setting& setting);
     std::unique_ptr<HttpJob> release() { return std::move(_job); }
 
-    // True when not a byte has moved for the job's idle limit.
+    // True when not a byte has moved for the job's idle limit. A handshake has all the time of the job: a server that
+    // has much to do comes to it late, and whoever went away and came back would stand at the end of the line.
     bool isIdle(SteadyTime now);
     // The same of so many seconds, as isIdle has seen it last.
     bool isStill(SteadyTime now, double seconds) const;
@@ -68,6 +71,7 @@ private:
     static size_t onHeader(char* data, size_t size, size_t count, void* self);
     static size_t onBody(char* data, size_t size, size_t count, void* self);
     static curl_socket_t onOpen(void* self, curlsocktype purpose, curl_sockaddr* address);
+    static CURLcode onHandshake(CURL* easy, void* context, void* self);
     static int onConnected(void* self, char* peerAddress, char* localAddress, int peerPort, int localPort);
 
     bool takeHeaderLine(std::string_view line);

@@ -348,9 +348,13 @@ void CurlTransport::Impl::finished(CurlSlot& slot, CURLcode code) {
     detach(slot);
     auto job = slot.release();
     if (anew) {
-        ++sentAnewCount;
-        kept.foundDead(job->origin, Steady::now());
-        job->onNewConnection = true;
+        if (code == CURLE_SSL_CONNECT_ERROR) {
+            job->metNoHandshake = true;
+        } else {
+            ++sentAnewCount;
+            kept.foundDead(job->origin, Steady::now());
+            job->onNewConnection = true;
+        }
         pending.addAgain(std::move(job));
         return;
     }

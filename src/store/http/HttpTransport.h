@@ -30,7 +30,7 @@ const char* description(TransportError error);
 
 struct HttpLimits {
     double totalSeconds = 60;          // from `perform` to the last byte, waiting for a connection included
-    double idleSeconds = 20;           // without a byte either way
+    double idleSeconds = 20;           // without a byte either way; until the connection is there, too, handshake aside
     size_t maxBodyBytes = 64u << 20;   // of the answer
     size_t maxHeaderBytes = 64u << 10; // of the answer, all header lines together
 };
@@ -120,7 +120,8 @@ struct CurlTransportOptions {
 // places until then, and the refused request is sent once more if its deadline allows.
 //
 // A request that fails on a kept connection before a byte of the answer came is sent once more on a new one, if
-// mayBeSentTwice: the server may have carried the first one out. Connections that nobody used for 30 seconds, or nearly
+// mayBeSentTwice: the server may have carried the first one out. One whose TLS handshake the server ended is sent once
+// more, whatever its method, since nobody has seen it. Connections that nobody used for 30 seconds, or nearly
 // as long as the server said it keeps them, are not used again; nor is any after the machine slept. Where nobody
 // acknowledges the bytes sent for 10 seconds, the connection is dead.
 class CurlTransport : public HttpTransport {
