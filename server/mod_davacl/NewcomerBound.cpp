@@ -10,7 +10,8 @@ std::vector<size_t> surplusOf(const std::vector<Newcomer>& all, std::chrono::ste
     std::map<std::string, std::vector<size_t>> byAddress;
     for (size_t i = 0; i < all.size(); ++i) byAddress[all[i].address].push_back(i);
     std::vector<size_t> surplus;
-    for (const auto& [address, members] : byAddress) {
+    for (const auto& entry : byAddress) {
+        const std::vector<size_t>& members = entry.second;
         size_t held = members.size();
         const auto isCrowded = [&](size_t i) { return members.size() > 2 * all[i].most; };
         std::vector<size_t> silent;
