@@ -146,7 +146,10 @@ int numberOfNames(X509* certificate) {
 } // namespace
 
 bool StoreCertificates::ensure(const std::vector<std::string>& hosts, std::chrono::seconds lifetime) {
-    if (areGoodFor(hosts, lifetime)) return false;
+    if (areGoodFor(hosts, lifetime)) {
+        showAuthority(); // stores of earlier versions showed their own certificate alone
+        return false;
+    }
     make(hosts, lifetime);
     return true;
 }
@@ -214,7 +217,13 @@ void StoreCertificates::make(const std::vector<std::string>& hosts, std::chrono:
     CXPathUtils_MakeCompletePath(_directory, 0700);
     writeFileDurably(caFile(), toPEM(authority.get()), 0644);
     writeFileDurably(keyFile(), toPEM(serverKey.get()), _keyMode);
-    writeFileDurably(certificateFile(), toPEM(server.get()), _keyMode);
+    writeFileDurably(certificateFile(), toPEM(server.get()) + toPEM(authority.get()), _keyMode);
+}
+
+void StoreCertificates::showAuthority() const {
+    const Certificate authority = readCertificate(caFile()), server = readCertificate(certificateFile());
+    const std::string chain = toPEM(server.get()) + toPEM(authority.get());
+    if (readFile(certificateFile()) != chain) writeFileDurably(certificateFile(), chain, _keyMode);
 }
 
 } // namespace rolvane

@@ -8,7 +8,8 @@
 namespace rolvane {
 
 // The store's own certificate authority and server certificate (EC P-256), as PEM files in one directory:
-//   ca.pem (0644) what clients trust, server.pem the server's certificate, server.key its key (the mode given).
+//   ca.pem (0644) what clients trust, server.pem the server's certificate and behind it the authority's, for clients
+//   that were told its fingerprint, server.key its key (the mode given).
 // The authority's key signs one certificate and is never written anywhere, so nobody can sign another one with it; a
 // renewal therefore makes a new authority, too.
 class StoreCertificates {
@@ -30,6 +31,7 @@ public:
 private:
     bool areGoodFor(const std::vector<std::string>& hosts, std::chrono::seconds lifetime) const;
     void make(const std::vector<std::string>& hosts, std::chrono::seconds lifetime);
+    void showAuthority() const;
 
     std::string _directory;
     mode_t _keyMode;

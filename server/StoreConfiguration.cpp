@@ -1,6 +1,7 @@
 #include "server/StoreConfiguration.h"
 
 #include "foundation/CXException.h"
+#include "foundation/Url.h"
 #include "server/HttpdTemplate.h"
 
 #include <algorithm>
@@ -81,6 +82,11 @@ std::string renderStoreConfiguration(const std::string& templateText, const Priv
                      {"KEEPALIVE_REQUESTS", std::to_string(std::max(options.maximumKeepAliveRequests, 0))},
                      {"LOG_LEVEL", options.logLevel},
                      {"EXTRA", joinedLines(options.extraConfiguration)}});
+}
+
+std::string storePasswordPath(const PrivateStoreOptions& options, const std::string& user) {
+    if (!options.keepsAccessLists() || options.authentication != StoreAuthentication::basic) return {};
+    return "/principals/users/" + Url::percentEncodeComponent(user);
 }
 
 std::string renderStoreUsers(const std::string& davDirectory, const std::vector<std::string>& users,

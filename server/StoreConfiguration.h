@@ -29,6 +29,10 @@ std::string renderStoreConfiguration(const std::string& templateText, const Priv
 std::string renderStoreUsers(const std::string& davDirectory, const std::vector<std::string>& users,
                              StoreAuthentication authentication, bool accessLists);
 
+// The URL path where a user changes the own password (mod_davacl/PasswordChange.h); "" where the store lets nobody do
+// that: with Digest, without access lists.
+std::string storePasswordPath(const PrivateStoreOptions& options, const std::string& user);
+
 // What store.plist keeps from one start to the next, and back. Unknown keys are left alone, missing ones take defaults.
 Dictionary storeOptionsToDictionary(const PrivateStoreOptions& options, int port);
 PrivateStoreOptions storeOptionsFromDictionary(const Dictionary& dictionary);

@@ -20,7 +20,7 @@ namespace {
 
 constexpr int kDirectory = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
 constexpr const char* kRootsOwn[] = {"conf", "tls"};
-constexpr const char* kServersOwn[] = {"run", "logs", "locks", "lists"};
+constexpr const char* kServersOwn[] = {"run", "logs", "locks", "lists", "own"};
 
 [[noreturn]] void fail(const std::string& reason) {
     throw CXException(kCXPrivateStoreException, reason);

@@ -14,7 +14,7 @@ namespace rolvane {
 //
 //   <state>             root       0711   settings, launcher lock, startup.log
 //   <state>/conf, tls   root       2750   group of httpd's user, which reads them; files 0640
-//   <state>/run, logs, locks, lists       httpd's user, 0700
+//   <state>/run, logs, locks, lists, own  httpd's user, 0700
 //   <state>/root        root       0711   where the documents lie, unless they are elsewhere
 //   <documents>/dav     httpd's user      everything in it is made as that user
 //

@@ -31,14 +31,14 @@ const char* urlPath(cmd_parms* cmd, const char* given) {
     return usable ? path : nullptr;
 }
 
-const char* checkDirectory(cmd_parms* cmd, const char* path) {
+const char* checkDirectory(cmd_parms* cmd, const char* what, const char* path) {
     struct stat info {};
     if (stat(path, &info) != 0 || !S_ISDIR(info.st_mode))
-        return apr_pstrcat(cmd->pool, "the directory of the access lists, ", path,
+        return apr_pstrcat(cmd->pool, "the directory of the ", what, ", ", path,
                            ", is not there: make it, with mode 0700 and the user that httpd runs as for its owner",
                            nullptr);
     if (info.st_mode & (S_IWGRP | S_IWOTH))
-        return apr_pstrcat(cmd->pool, "the directory of the access lists, ", path,
+        return apr_pstrcat(cmd->pool, "the directory of the ", what, ", ", path,
                            ", may be written by others: give it mode 0700", nullptr);
     return nullptr;
 }
@@ -50,7 +50,7 @@ const char* setBase(cmd_parms* cmd, void*, const char* base, const char* lists) 
     if (!c->base) return "the base must be a URL path below the root, such as /dav, without escapes, \"..\" or \"//\"";
     c->lists = ap_server_root_relative(cmd->pool, lists);
     if (!c->lists) return "the second argument must be the directory of the access lists";
-    return checkDirectory(cmd, c->lists);
+    return checkDirectory(cmd, "access lists", c->lists);
 }
 
 const char* setPrincipals(cmd_parms* cmd, void*, const char* path) {
@@ -76,6 +76,13 @@ const char* setLastUse(cmd_parms* cmd, void*, const char* path) {
     Configuration* c = ofServer(cmd->server);
     c->lastUse = ap_server_root_relative(cmd->pool, path);
     return c->lastUse ? nullptr : "the argument must be the path of a directory";
+}
+
+const char* setOwnPasswords(cmd_parms* cmd, void*, const char* path) {
+    Configuration* c = ofServer(cmd->server);
+    c->ownPasswords = ap_server_root_relative(cmd->pool, path);
+    if (!c->ownPasswords) return "the argument must be the path of a directory";
+    return checkDirectory(cmd, "users' own passwords", c->ownPasswords);
 }
 
 const char* addUsers(cmd_parms* cmd, void*, const char* provider) {
@@ -171,6 +178,9 @@ const char* complaintAbout(const server_rec* server) {
     if (core->ap_document_root &&
         (isWithin(c->lists, core->ap_document_root) || isWithin(core->ap_document_root, c->lists)))
         return "the directory of the access lists and the DocumentRoot must not lie within each other";
+    if (c->ownPasswords && core->ap_document_root &&
+        (isWithin(c->ownPasswords, core->ap_document_root) || isWithin(core->ap_document_root, c->ownPasswords)))
+        return "the directory of users' own passwords and the DocumentRoot must not lie within each other";
     return nullptr;
 }
 
@@ -194,6 +204,11 @@ bool slowsGuesses(const request_rec* r) {
 const char* lastUseDirectoryOf(const request_rec* r) {
     const Configuration* c = ofServer(r->server);
     return c ? c->lastUse : nullptr;
+}
+
+const char* ownPasswordsOf(const request_rec* r) {
+    const Configuration* c = ofServer(r->server);
+    return c ? c->ownPasswords : nullptr;
 }
 
 int mostNewcomers(const server_rec* server) {
@@ -238,6 +253,7 @@ void* mergeConfigurations(apr_pool_t* pool, void* base, void* more) {
     if (inner->users) merged->users = inner->users;
     if (inner->userFile) merged->userFile = inner->userFile;
     if (inner->lastUse) merged->lastUse = inner->lastUse;
+    if (inner->ownPasswords) merged->ownPasswords = inner->ownPasswords;
     if (inner->slows >= 0) merged->slows = inner->slows;
     if (inner->strict >= 0) merged->strict = inner->strict;
     if (inner->parks >= 0) merged->parks = inner->parks;
@@ -333,6 +349,8 @@ const command_rec kDirectives[] = {
      "whether passwords are not looked at for a while after wrong ones from the same address: Off by default"},
     {"DavAclLastUse", asCommand(setLastUse), nullptr, RSRC_CONF, TAKE1,
      "a directory in which the date of the file with a user's name tells when that user signed in last"},
+    {"DavAclOwnPasswords", asCommand(setOwnPasswords), nullptr, RSRC_CONF, TAKE1,
+     "a directory for the passwords that users choose themselves; without it they cannot"},
     {"DavAclNewcomers", asCommand(setNewcomers), nullptr, RSRC_CONF, TAKE1,
      "how many connections of one address, in one process, may be silent without a sign-in: 0, no bound, by default"},
     {"DavAclNews", asCommand(setNews), nullptr, RSRC_CONF, FLAG,

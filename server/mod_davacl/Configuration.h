@@ -13,6 +13,7 @@ struct Configuration {
     apr_array_header_t* users = nullptr; // of const char*: the authentication providers that know who exists
     const char* userFile = nullptr;      // null: none; who stands in it exists, and no provider is asked
     const char* lastUse = nullptr;       // a directory; null: nobody's last use is noted
+    const char* ownPasswords = nullptr;  // a directory; null: users cannot change their passwords
     int entries = 0;                     // the most that a list holds
     int strict = -1;                     // whether a way around the lists keeps httpd from starting; -1: not said
     int parks = -1;                      // whether silent connections wait without a thread; -1: not said
@@ -37,6 +38,7 @@ const char* userFileOf(const request_rec* r);
 // DavAclSlowGuesses, and DavAclLastUse's argument (null when there is none).
 bool slowsGuesses(const request_rec* r);
 const char* lastUseDirectoryOf(const request_rec* r);
+const char* ownPasswordsOf(const request_rec* r); // DavAclOwnPasswords' argument; null when there is none
 // DavAclParkConnections, of the host that the connection came to.
 bool parksConnections(const server_rec* server);
 int mostNewcomers(const server_rec* server); // 0: no bound

@@ -2,6 +2,8 @@
 
 #include "server/mod_davacl/Configuration.h"
 #include "server/mod_davacl/LastUse.h"
+#include "server/mod_davacl/OwnPasswords.h"
+#include "server/mod_davacl/PasswordChange.h"
 #include "server/mod_davacl/PasswordLines.h"
 #include "server/mod_davacl/SignInBrake.h"
 #include "server/mod_davacl/SignInMemory.h"
@@ -94,7 +96,10 @@ authn_status check(request_rec* r, const char* user, const char* password) {
         return AUTH_GENERAL_ERROR;
     }
     const bool known = found.answer == PasswordLines::Answer::known;
-    const std::string hash = known ? found.hash : hashInstead(*found.others, numberOf(user));
+    const std::string given = known ? found.hash : hashInstead(*found.others, numberOf(user));
+    const char* const own = ownPasswordsOf(r);
+    const std::string hash = own ? OwnPasswords(own).inForce(user, given) : given;
+    if (own && known) noteHashes(r, given.c_str(), hash.c_str());
     const auto isRight = [&] {
         ap_log_rerror(APLOG_MARK, APLOG_DEBUG, 0, r, "davacl: the password of %s is checked in full", user);
         const bool right = apr_password_validate(password, hash.c_str()) == APR_SUCCESS;

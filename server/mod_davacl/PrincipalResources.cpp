@@ -1,6 +1,7 @@
 #include "server/mod_davacl/PrincipalResources.h"
 
 #include "server/mod_davacl/GroupFile.h"
+#include "server/mod_davacl/PasswordChange.h"
 #include "server/mod_davacl/Reports.h"
 
 #include <cstring>
@@ -278,6 +279,8 @@ int serve(request_rec* r) {
     if (std::strcmp(r->method, "PROPFIND") == 0) return propfind(r, *c, *place);
     if (r->method_number == M_GET) return page(r, *c, *place); // HEAD, too
     if (std::strcmp(r->method, "REPORT") == 0) return reportOnPrincipals(r, *c);
+    if (r->method_number == M_POST && place->kind == Place::Kind::principal && isSelf(r, *c, place->principal))
+        return changePassword(r);
     return HTTP_METHOD_NOT_ALLOWED;
 }
 
