@@ -82,6 +82,7 @@ const std::pair<PasswordSource::Kind, const char*> kPasswordKinds[] = {
     {PasswordSource::Kind::command, "command"},
     {PasswordSource::Kind::credential, "credential"},
     {PasswordSource::Kind::file, "file"},
+    {PasswordSource::Kind::keyring, "keyring"},
 };
 const std::pair<Authentication, const char*> kAuthentications[] = {
     {Authentication::automatic, "automatic"},

@@ -17,7 +17,8 @@ struct PasswordSource {
         none,       // no password: requests go out without credentials
         command,    // the first line that `value`, run by /bin/sh, writes to standard output (at most 10 s, 4 KiB)
         credential, // the file `value` in $CREDENTIALS_DIRECTORY
-        file        // the file at the path `value`; refused when others may read or write it
+        file,       // the file at the path `value`; refused when others may read or write it
+        keyring     // the item `value` of the user's keyring (SecretService.h)
     };
     Kind kind = Kind::none;
     std::string value;

@@ -1,6 +1,7 @@
 #include "store/account/PasswordReader.h"
 
 #include "foundation/CXException.h"
+#include "store/account/SecretService.h"
 
 #include <algorithm>
 #include <cerrno>
@@ -190,6 +191,7 @@ std::string readPassword(const PasswordSource& source) {
     case PasswordSource::Kind::command: return fromCommand(source.value);
     case PasswordSource::Kind::credential: return fromCredential(source.value);
     case PasswordSource::Kind::file: return fromFile(source.value, true);
+    case PasswordSource::Kind::keyring: return secretFromService(source.value);
     }
     return {};
 }
