@@ -1,0 +1,31 @@
+#include "UnitState.h"
+
+#include <cstdio>
+#include <memory>
+
+namespace rolvane::cli {
+
+UnitState unitStateFrom(const std::string& shown) {
+    const auto says = [&](const std::string& line) {
+        return ("\n" + shown).find("\n" + line + "\n") != std::string::npos;
+    };
+    return {says("LoadState=loaded"), says("UnitFileState=enabled"), says("NeedDaemonReload=yes"),
+            says("NoNewPrivileges=yes") && says("PrivateTmp=yes")};
+}
+
+std::optional<UnitState> managersUnitState() {
+    struct Close {
+        void operator()(FILE* pipe) const { pclose(pipe); }
+    };
+    const std::unique_ptr<FILE, Close> pipe(
+        popen("timeout 5 systemctl --user show -p LoadState,UnitFileState,NeedDaemonReload,NoNewPrivileges,PrivateTmp "
+              "RolvaneManager.service 2>/dev/null",
+              "re"));
+    std::string shown;
+    char part[1024];
+    while (pipe && std::fgets(part, sizeof part, pipe.get())) shown += part;
+    if (shown.find("LoadState=") == std::string::npos) return std::nullopt;
+    return unitStateFrom(shown);
+}
+
+} // namespace rolvane::cli

@@ -1,0 +1,175 @@
+#include "CommandWorld.h"
+#include "Neighbour.h"
+#include "TerminalSession.h"
+
+#include "foundation/Paths.h"
+
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+
+namespace rolvane::test {
+namespace {
+
+class TheDoctor : public testing::Test {
+protected:
+    nlohmann::json examine(int status = kDone) { return world.json({"doctor"}, status); }
+    static nlohmann::json of(const nlohmann::json& told, const std::string& check) {
+        for (const auto& finding : told["findings"])
+            if (finding["check"] == check) return finding;
+        return {{"check", check}, {"state", "missing"}};
+    }
+    // Each failure has a sentence and something to do.
+    static void expectFailed(const nlohmann::json& told, const std::string& check, const std::string& toDo) {
+        const auto finding = of(told, check);
+        EXPECT_EQ(finding["state"], "failed") << told.dump(2);
+        EXPECT_FALSE(finding.value("what", "").empty());
+        EXPECT_NE(finding["toDo"].is_string() ? finding["toDo"].get<std::string>().find(toDo) : std::string::npos,
+                  std::string::npos)
+            << finding.dump(2);
+    }
+    CommandWorld world;
+};
+
+TEST_F(TheDoctor, FindsNothingWrongWithAnEmptyHome) {
+    const auto told = examine();
+    EXPECT_EQ(told["well"], true);
+    EXPECT_EQ(of(told, "account")["toDo"], "rolvane setup");
+    EXPECT_FALSE(std::filesystem::exists(world.home / "data/rolvane/contacts.db")) << "nothing is made";
+}
+
+TEST_F(TheDoctor, LooksAtEverything) {
+    world.bus();
+    world.makeAccount();
+    world.add("Ada");
+    ASSERT_EQ(world.rolvane({"publish"}).status, kDone);
+    const auto told = examine();
+    EXPECT_EQ(told["well"], true) << told.dump(2);
+    for (const char* check : {"database", "preferences", "account", "address", "login", "authority", "clock",
+                              "rights", "webdav", "structure", "computers", "bus", "launcher", "queue"})
+        EXPECT_EQ(of(told, check)["state"], "well") << check << told.dump(2);
+    EXPECT_NE(of(told, "unit")["state"], "missing");
+    const Ran text = world.rolvane({"doctor"});
+    EXPECT_GE(lineCount(text.output), told["findings"].size()) << text;
+    EXPECT_NE(text.errors.find("All is well."), std::string::npos) << text;
+}
+
+TEST_F(TheDoctor, NamesAStoreThatIsAway) {
+    world.makeAccount();
+    world.store().stop(PrivateStore::Stop::atOnce);
+    const auto told = examine(kFailure);
+    expectFailed(told, "address", "rolvane account test");
+    EXPECT_EQ(of(told, "login")["state"], "unknown");
+    EXPECT_EQ(of(told, "database")["state"], "note") << "the rest is looked at all the same";
+    EXPECT_NE(of(told, "launcher")["state"], "missing");
+}
+
+TEST_F(TheDoctor, NamesAWrongPasswordAndAMissingOne) {
+    world.makeAccount();
+    const std::string password = world.json({"account", "show"})["password"]["value"];
+    std::ofstream(password) << "wrong\n";
+    const auto refused = examine(kFailure);
+    EXPECT_EQ(of(refused, "address")["state"], "well");
+    expectFailed(refused, "login", "rolvane account set --ask-password");
+    std::filesystem::remove(password);
+    expectFailed(examine(kFailure), "account", "rolvane account set --ask-password");
+}
+
+TEST_F(TheDoctor, NamesAnAuthorityThatIsNotBelieved) {
+    world.makeAccount();
+    ASSERT_EQ(world.rolvane({"account", "set", "--ca-file", ""}).status, kDone);
+    expectFailed(examine(kFailure), "address", "rolvane account test");
+}
+
+TEST_F(TheDoctor, NamesADaemonThatShouldRun) {
+    world.makeAccount();
+    world.add("Ada");
+    ASSERT_EQ(world.rolvane({"publish"}).status, kDone);
+    ASSERT_EQ(world.rolvane({"daemon", "stop"}).status, kDone);
+    expectFailed(examine(kFailure), "launcher", "rolvane daemon start");
+}
+
+TEST_F(TheDoctor, NamesATreeThatLacksSomething) {
+    world.makeAccount();
+    world.add("Ada");
+    ASSERT_EQ(world.rolvane({"publish"}).status, kDone);
+    ASSERT_EQ(world.rolvane({"daemon", "stop"}).status, kDone);
+    std::filesystem::remove(world.treeDirectory() + "/dateFile");
+    expectFailed(examine(kFailure), "structure", "rolvane sync");
+}
+
+TEST_F(TheDoctor, NamesAnotherComputerThatHasPublished) {
+    world.makeAccount();
+    world.add("Ada");
+    ASSERT_EQ(world.rolvane({"publish"}).status, kDone);
+    ASSERT_EQ(world.rolvane({"daemon", "stop"}).status, kDone);
+    const std::string info = world.treeDirectory() + "/info";
+    std::string text = readFile(info);
+    const size_t serial = text.find("<string>") + 8;
+    text[serial] = text[serial] == 'A' ? 'B' : 'A';
+    std::ofstream(info) << text;
+    expectFailed(examine(kFailure), "computers", "rolvane status");
+}
+
+TEST_F(TheDoctor, NamesADatabaseThatIsGone) {
+    world.makeAccount();
+    world.add("Ada");
+    ASSERT_EQ(world.rolvane({"publish"}).status, kDone);
+    ASSERT_EQ(world.rolvane({"daemon", "stop"}).status, kDone);
+    std::filesystem::remove_all(world.home / "data/rolvane");
+    expectFailed(examine(kFailure), "database", "rolvane");
+}
+
+// Names, numbers, addresses and secrets stand wherever one can.
+TEST_F(TheDoctor, ABundleTellsNothingOfAnybody) {
+    world.store().addUser("zzuser", UserWorld::kPassword);
+    const std::string word = "zzsecretword";
+    world.store().addUser("zzuser", word);
+    const Ran set = world.rolvane({"account", "set", "--user", "zzuser", "--endpoint", world.store().endpointTemplate(),
+                                   "--ca-file", world.store().caFile(), "--ask-password"},
+                                  word + "\n");
+    ASSERT_EQ(set.status, kDone) << set;
+    world.add("Zzfirst", {"--last", "Zzlast", "--phone", "mobile:+49 555 0987654", "--email", "work:zzmail@zz.example",
+                          "--note", "zznote"});
+    world.group("Zzgroup", {"Zzfirst"});
+    ASSERT_EQ(world.rolvane({"publish"}).status, kDone);
+    const std::string port = ":" + std::to_string(world.store().status().port);
+    const auto expectNothing = [&](const std::string& scene) {
+        const std::string path = world.home / "zzbundle.json";
+        std::filesystem::remove(path);
+        (void)world.rolvane({"doctor", "--bundle", path});
+        const std::string text = readFile(path);
+        const auto told = nlohmann::json::parse(text);
+        EXPECT_GE(told["checks"].size(), 8U) << text;
+        std::string lower = text;
+        std::transform(lower.begin(), lower.end(), lower.begin(), [](unsigned char c) { return std::tolower(c); });
+        for (const std::string& mark :
+             {std::string("zz"), std::string("0987654"), word, std::string("localhost"), std::string("127.0.0.1"), port,
+              world.home.path(), std::string("http"), std::string("/"), std::string("@")})
+            EXPECT_EQ(lower.find(mark), std::string::npos) << scene << ": " << mark << "\n" << text;
+    };
+    expectNothing("all is well");
+    std::ofstream(world.json({"account", "show"})["password"]["value"].get<std::string>()) << "zzwrong\n";
+    expectNothing("a wrong password");
+    world.store().stop(PrivateStore::Stop::atOnce);
+    expectNothing("no store");
+    ASSERT_EQ(world.rolvane({"daemon", "stop"}).status, kDone);
+    std::ofstream(world.home / "data/rolvane/contacts.db") << "zz no database";
+    expectNothing("a damaged database");
+    std::ofstream(world.home / "config/rolvane/account.plist") << "zz no account";
+    expectNothing("a damaged account");
+}
+
+TEST_F(TheDoctor, OnATerminalWithoutColoursAndInTheCLocaleItTellsTheSame) {
+    world.home.setVariable("NO_COLOR", "1");
+    world.home.setVariable("LANG", "C");
+    const Ran piped = world.rolvane({"doctor"});
+    TerminalSession session(quotedForShell(UserWorld::rolvaneProgram()) + " doctor", world.home.environment());
+    EXPECT_EQ(session.end(), kDone);
+    EXPECT_EQ(session.shown().find('\033'), std::string::npos);
+    EXPECT_NE(session.shown().find(piped.output.substr(0, piped.output.find('\n'))), std::string::npos)
+        << session.shown() << piped;
+}
+
+} // namespace
+} // namespace rolvane::test
