@@ -1,15 +1,11 @@
+#include "AccountTrial.h"
 #include "Context.h"
 #include "FailureText.h"
 #include "Terminal.h"
 #include "ValueNames.h"
 
-#include "daemon/DaemonControl.h"
-#include "daemon/RetrySchedule.h"
-#include "foundation/Paths.h"
-#include "foundation/Preferences.h"
 #include "store/dav/CXDAVManager.h"
 
-#include <filesystem>
 #include <fmt/format.h>
 
 namespace rolvane::cli {
@@ -21,17 +17,8 @@ using Json = nlohmann::ordered_json;
 struct AccountOptions {
     std::string user, endpoint, secureEndpoint, host, caFile, authentication = "automatic";
     std::string passwordCommand, passwordCredential, passwordFile;
-    bool askPassword = false, noPassword = false, plainLoopback = false, store = false;
+    bool keyring = false, askPassword = false, noPassword = false, plainLoopback = false, store = false;
 };
-
-std::string passwordPath() {
-    return configDirectory() + "/password";
-}
-
-// The daemon reads the files from another directory than this one. Empty stays empty.
-std::string absolutePath(const std::string& path) {
-    return path.empty() ? path : std::filesystem::absolute(path).lexically_normal().string();
-}
 
 Authentication authenticationNamed(const std::string& name) {
     return name == "basic"    ? Authentication::basic
@@ -39,40 +26,23 @@ Authentication authenticationNamed(const std::string& name) {
                               : Authentication::automatic;
 }
 
-PasswordSource passwordSource(const AccountOptions& options, const PasswordSource& former, const std::string& user) {
+PasswordSource passwordSource(const AccountOptions& options, const CXDAVAccount& account) {
+    const PasswordSource& former = account.passwordSource;
+    const UserName& user = account.user;
     using Kind = PasswordSource::Kind;
     if (options.noPassword) return {Kind::none, {}};
     if (!options.passwordCommand.empty()) return {Kind::command, options.passwordCommand};
     if (!options.passwordCredential.empty()) return {Kind::credential, options.passwordCredential};
     if (!options.passwordFile.empty()) return {Kind::file, absolutePath(options.passwordFile)};
-    if (!options.askPassword) return former;
-    const std::string password = readSecret("Password of " + user + ": ");
+    if (!options.askPassword && !options.keyring) return former;
+    const std::string password = readSecret("Password of " + user.str() + ": ");
     if (password.empty()) throw CommandError(kUsage, "The password is empty. Nothing was changed.");
-    writeFileDurably(passwordPath(), password + "\n", 0600);
-    return {Kind::file, passwordPath()};
-}
-
-// Refuses a source that gives no password, in the source's own words.
-void requirePassword(const CXDAVAccount& account) {
-    try {
-        (void)account.password();
-    } catch (const CXException& error) {
-        throw CommandError(kRefused, error.reason());
-    }
+    if (options.keyring) return keptInKeyring(account, password);
+    return keptInFile(password);
 }
 
 std::optional<CXDAVAccount> savedAccount() {
     return CXDAVAccount::load();
-}
-
-// The last pass has ended for that, and the daemon with it: nothing else would start it.
-bool passwordWasRefused() {
-    try {
-        const auto outcome = lastOutcome(Preferences::shared());
-        return outcome && resultOf(*outcome).passwordRefused;
-    } catch (const CXException&) {
-        return false; // damaged preferences are told by whoever needs them
-    }
 }
 
 void setAccount(Context& context, CLI::App& command, const AccountOptions& options) {
@@ -94,19 +64,13 @@ void setAccount(Context& context, CLI::App& command, const AccountOptions& optio
     if (given("--plain-loopback")) account.plainLoopback = options.plainLoopback;
     if (account.user.empty()) throw CommandError(kUsage, "Name the user with --user.");
     if (const auto problem = account.problem()) throw CommandError(kUsage, *problem);
-    account.passwordSource = passwordSource(options, account.passwordSource, account.user.str());
+    account.passwordSource = passwordSource(options, account);
     if (const auto problem = account.problem()) throw CommandError(kUsage, *problem);
     if (given("--password-file")) requirePassword(account); // a file that cannot be used is better told now
     account.save();
     context.say(fmt::format("The account of {} at {} is saved. `rolvane account test` tries it.", account.user.str(),
                             account.endpoint));
-    if (const DaemonControl daemon; daemon.running()) {
-        daemon.restart(); // it reads the account once
-        context.say("RolvaneManager was started anew with it.");
-    } else if (passwordWasRefused()) {
-        daemon.start();
-        context.say("RolvaneManager, which had ended because the password was refused, runs again and goes on.");
-    }
+    accountWasSaved(context);
     if (!formerUser.empty() && formerUser != account.user.str())
         context.say("The account's user is another one than before: the next pass starts from nothing and compares "
                     "everything.");
@@ -118,6 +82,7 @@ const char* sourceName(PasswordSource::Kind kind) {
     case PasswordSource::Kind::command: return "command";
     case PasswordSource::Kind::credential: return "credential";
     case PasswordSource::Kind::file: return "file";
+    case PasswordSource::Kind::keyring: return "keyring";
     }
     return "none";
 }
@@ -147,38 +112,6 @@ void showAccount(Context& context) {
                              account->passwordSource.value));
     if (!account->caFile.empty()) context.line(fmt::format("{:<15}{}", "Authority", account->caFile));
     if (account->plainLoopback) context.line(fmt::format("{:<15}{}", "Transport", "plain http on this machine"));
-}
-
-// Sentences for a usable store: each names an ability that it lacks, and the consequence.
-std::vector<std::string> consequences(const StoreTrial& trial) {
-    std::vector<std::string> lines;
-    if (!trial.locks && trial.conditions)
-        lines.emplace_back(
-            "It keeps no locks: of two who change one file at once the second is told, and tries again.");
-    if (!trial.locks && !trial.conditions)
-        lines.emplace_back(
-            "It keeps no locks and heeds no conditions: of two who change one file at once the later one "
-            "wins. Publish from one machine at a time.");
-    if (!trial.dates && trial.tags) lines.emplace_back("Its listings tell no dates: versions are told by their tags.");
-    if (trial.dates && !trial.tags)
-        lines.emplace_back("Its listings tell no tags: versions are told by date and size.");
-    if (!trial.dates && !trial.tags)
-        lines.emplace_back("Its listings tell neither dates nor tags: every pass reads everything.");
-    if (!trial.accessLists)
-        lines.emplace_back(
-            "It keeps no access lists: who may read is the store's own matter, and `rolvane share` cannot "
-            "change it.");
-    return lines;
-}
-
-Json trialJson(const StoreTrial& trial) {
-    return {{"usable", !trial.hindrance},
-            {"hindrance", trial.hindrance ? Json(trial.hindrance->what) : Json()},
-            {"dates", trial.dates},
-            {"tags", trial.tags},
-            {"locks", trial.locks},
-            {"conditions", trial.conditions},
-            {"accessLists", trial.accessLists}};
 }
 
 // Signs in, tries what a publication does, and looks whether the tree is there. Exit code 5 for a refused login or
@@ -227,6 +160,8 @@ void addAccountCommands(CLI::App& app, Context& context) {
             auto* password = c.add_option_group("password", "Where the password comes from; it is never an argument");
             password->add_flag("--ask-password", o->askPassword,
                                "Ask for it (or read a line of standard input) and keep it in a file of mode 0600");
+            password->add_flag("--keyring", o->keyring,
+                               "Ask for it (or read a line of standard input) and keep it in the keyring");
             password->add_option("--password-command", o->passwordCommand, "Command whose first line of output it is");
             password->add_option("--password-credential", o->passwordCredential, "Name of a systemd credential");
             password->add_option("--password-file", o->passwordFile, "File of mode 0600")->type_name(kFileValue);

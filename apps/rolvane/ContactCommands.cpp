@@ -313,6 +313,10 @@ void remove(Context& context, const std::vector<std::string>& names, bool yes) {
 
 } // namespace
 
+void importFiles(Context& context, const std::vector<std::string>& files) {
+    importCards(context, {files, {}, false});
+}
+
 void addContactCommands(CLI::App& app, Context& context) {
     const auto imports = std::make_shared<ImportOptions>();
     addCommand(

@@ -38,6 +38,15 @@ const std::map<std::string, const char*>& examples() {
         {"group rename", "  rolvane group rename Family Kin"},
         {"group choose", "  rolvane group choose Family \"Ada Miller\" Email Home\n"
                          "  rolvane group choose Family \"Ada Miller\" Email --clear"},
+        {"setup", "  rolvane setup\n"
+                  "  rolvane setup 'rolvane:1:...'\n"
+                  "  rolvane setup --here --import friends.vcf --no-input\n"
+                  "  rolvane setup --endpoint https://dav.example.org/dav --user ada --keyring"},
+        {"doctor", "  rolvane doctor\n"
+                   "  rolvane doctor --json\n"
+                   "  rolvane doctor --bundle report.json"},
+        {"invite", "  rolvane invite bob\n"
+                   "  rolvane invite bob --ask-password --qr"},
         {"account set", "  rolvane account set --user ada --endpoint 'https://dav.example.org/dav/{user}/Contacts' \\\n"
                         "      --password-command 'pass show dav.example.org'\n"
                         "  rolvane account set --password-file ~/.config/rolvane/password"},
@@ -83,7 +92,8 @@ const std::map<std::string, const char*>& examples() {
          "  rolvane books link https://cloud.example.org/remote.php/dav/addressbooks/users/ada/contacts/ \\\n"
          "      --user ada --password-command 'pass show cloud.example.org'"},
         {"books device remove", "  rolvane books device remove phone"},
-        {"store user add", "  rolvane store user add alice"},
+        {"store user add", "  rolvane store user add alice\n"
+                           "  rolvane store user add bob --invite"},
     };
     return all;
 }

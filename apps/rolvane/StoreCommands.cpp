@@ -1,9 +1,14 @@
 #include "Context.h"
+#include "Invite.h"
 #include "Terminal.h"
 #include "ValueNames.h"
 
+#include "foundation/Paths.h"
 #include "server/PrivateStore.h"
+#include "server/StoreConfiguration.h"
+#include "store/account/CertificateChain.h"
 
+#include <algorithm>
 #include <fmt/format.h>
 
 namespace rolvane::cli {
@@ -16,6 +21,7 @@ struct StoreOptions {
     std::string directory, root, authentication = "basic", user;
     int port = 0;
     bool noTLS = false, noHTTP2 = false, accessLog = false, now = false;
+    bool invite = false, renew = false, qr = false;
 };
 
 // The store as it was started last, so that later commands need only its directory.
@@ -81,6 +87,50 @@ std::string newPassword(const std::string& user) {
     return password;
 }
 
+// The store has to show its authority to whoever is to find it by its fingerprint.
+void requireShownAuthority(const PrivateStore& store, const std::string& fingerprint) {
+    if (!store.status().running)
+        throw CommandError(kFailed, "The store does not run. `rolvane store start` starts it; then invite again.");
+    if (!withFingerprint(certificatesShownAt(Url(store.baseURL())), fingerprint))
+        throw CommandError(kFailed, "The store was started by an earlier version and does not show its authority yet. "
+                                    "`rolvane store stop && rolvane store start`, then invite again.");
+}
+
+void invite(Context& context, const StoreOptions& options) {
+    PrivateStore store(knownOptions(options));
+    const std::vector<std::string> users = store.users();
+    if (!options.renew && std::find(users.begin(), users.end(), options.user) != users.end())
+        throw CommandError(kRefused,
+                           fmt::format("There is a user {0} already. `--renew` gives {0} a new first password, "
+                                       "and the one that {0} has ends.",
+                                       options.user));
+    Invitation invitation;
+    invitation.endpoint = store.endpointTemplate();
+    if (!invitation.endpoint.starts_with("https:"))
+        throw CommandError(kFailed, "The store speaks plain http, and an invitation holds a password. Start it with "
+                                    "TLS.");
+    invitation.user = options.user;
+    const auto authority = certificatesIn(readFile(store.caFile()));
+    if (authority.empty())
+        throw CommandError(kFailed, fmt::format("The authority's file {} holds no certificate. `rolvane store stop && "
+                                                "rolvane store start` makes another one.",
+                                                store.caFile()));
+    invitation.fingerprint = authority.front().fingerprint;
+    requireShownAuthority(store, invitation.fingerprint);
+    invitation.password = makePassword();
+    invitation.passwordPath = storePasswordPath(knownOptions(options), options.user);
+    invitation.inviter = inviterOn(invitation.endpoint);
+    store.addUser(options.user, invitation.password);
+    printInvitation(context, invitation, options.qr);
+}
+
+void addUser(Context& context, const StoreOptions& options) {
+    if (options.invite) return invite(context, options);
+    PrivateStore known(knownOptions(options));
+    known.addUser(options.user, newPassword(options.user));
+    context.say(fmt::format("{} can sign in.", options.user));
+}
+
 } // namespace
 
 void addStoreCommands(CLI::App& app, Context& context) {
@@ -126,12 +176,16 @@ void addStoreCommands(CLI::App& app, Context& context) {
         directory(c);
         c.add_option("user", o->user, "User name")->required()->type_name(kStoreUserValue);
     };
-    addCommand(*user, context, "add", "Add a user, or set a new password (asked for, or a line of standard input)",
-               named, [&context, o] {
-                   PrivateStore known(knownOptions(*o));
-                   known.addUser(o->user, newPassword(o->user));
-                   context.say(fmt::format("{} can sign in.", o->user));
-               });
+    addCommand(
+        *user, context, "add", "Add a user, or set a new password (asked for, or a line of standard input)",
+        [&](CLI::App& c) {
+            named(c);
+            auto* invites =
+                c.add_flag("--invite", o->invite, "Make the first password, and print one line for `rolvane setup`");
+            c.add_flag("--renew", o->renew, "Invite a user who is there; the password of before ends")->needs(invites);
+            c.add_flag("--qr", o->qr, "Show the line as a QR code, too")->needs(invites);
+        },
+        [&context, o] { addUser(context, *o); });
     addCommand(*user, context, "remove", "Take a user's account away; the files stay", named, [&context, o] {
         if (!PrivateStore(knownOptions(*o)).removeUser(o->user))
             throw CommandError(kNotFound, fmt::format("The store has no user {}.", o->user));

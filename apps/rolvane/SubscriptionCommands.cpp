@@ -3,6 +3,7 @@
 #include "PassReport.h"
 #include "Passes.h"
 #include "Publication.h"
+#include "Subscribe.h"
 #include "Subscriptions.h"
 #include "ValueNames.h"
 
@@ -200,6 +201,12 @@ void listSubscriptions(Context& context) {
 }
 
 } // namespace
+
+void subscribeTo(Context& context, const std::string& user) {
+    SubscribeOptions options;
+    options.named = user;
+    subscribe(context, options);
+}
 
 void addSubscriptionCommands(CLI::App& app, Context& context) {
     const auto options = std::make_shared<SubscribeOptions>();

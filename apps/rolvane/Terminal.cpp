@@ -17,8 +17,9 @@ std::string readSecret(const std::string& prompt) {
     ::tcgetattr(STDIN_FILENO, &shown);
     termios hidden = shown;
     hidden.c_lflag &= ~static_cast<tcflag_t>(ECHO);
-    std::cerr << prompt << std::flush;
+    // In this order: what is typed behind the prompt is neither shown nor dropped.
     ::tcsetattr(STDIN_FILENO, TCSAFLUSH, &hidden);
+    std::cerr << prompt << std::flush;
     std::getline(std::cin, secret);
     ::tcsetattr(STDIN_FILENO, TCSAFLUSH, &shown);
     std::cerr << "\n";
@@ -29,6 +30,13 @@ size_t terminalColumns(int descriptor) {
     winsize size{};
     if (::isatty(descriptor) != 1 || ::ioctl(descriptor, TIOCGWINSZ, &size) != 0) return 0;
     return size.ws_col;
+}
+
+std::optional<std::string> readLine(const std::string& prompt) {
+    if (::isatty(STDIN_FILENO) == 1) std::cerr << prompt << std::flush;
+    std::string line;
+    if (!std::getline(std::cin, line)) return std::nullopt;
+    return line;
 }
 
 } // namespace rolvane::cli

@@ -5,6 +5,7 @@
 #include "ManualCommand.h"
 #include "SafeText.h"
 #include "SeeingCommands.h"
+#include "SetupCommands.h"
 #include "Suggestions.h"
 
 #include <iostream>
@@ -19,8 +20,8 @@ constexpr const char* kFooter =
 
 Examples:
   rolvane import friends.vcf
-  rolvane store start && rolvane store user add alice
-  rolvane account set --user alice --endpoint ... --ca-file ... --ask-password
+  rolvane setup
+  rolvane setup 'rolvane:1:...'
   rolvane publish && rolvane watch
   rolvane subscribe bob && rolvane list --of bob)";
 
@@ -88,6 +89,9 @@ int main(int argc, char** argv) {
     addDuplicateCommands(app, context);
     addGroupCommands(app, context);
     addAccountCommands(app, context);
+    addSetupCommands(app, context);
+    addInviteCommands(app, context);
+    addDoctorCommands(app, context);
     addSharingCommands(app, context);
     addShareCommands(app, context);
     addSubscriptionCommands(app, context);

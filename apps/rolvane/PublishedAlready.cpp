@@ -1,0 +1,71 @@
+#include "PublishedAlready.h"
+
+#include "conduits/PublishedLayout.h"
+#include "conduits/store/StoreComparison.h"
+#include "engine/memory/EngineState.h"
+#include "engine/memory/StateRows.h"
+#include "model/PayloadKeys.h"
+#include "model/RemoteLocationMap.h"
+
+#include <fmt/format.h>
+
+namespace rolvane::cli {
+
+namespace {
+
+// The serial number that the daemon knows the account's own tree by; "" for none.
+std::string knownSerial(const Preferences& preferences) {
+    // The row that it would be stored in says where it stands.
+    const Dictionary itself{
+        {kConduitVaultra,
+         Dictionary{{kPriorState, Dictionary{{kSelf.str(), Dictionary{{std::string(kSerialNumber), ""}}}}}}}};
+    for (const auto& [row, value] : stateRows(itself))
+        if (value.isString()) return preferences.get(kDaemonDomain, row).string();
+    return {};
+}
+
+const char* name(PublishedAlready::By by) {
+    switch (by) {
+    case PublishedAlready::By::nobody: return "nobody";
+    case PublishedAlready::By::thisComputer: return "thisComputer";
+    case PublishedAlready::By::another: break;
+    }
+    return "another";
+}
+
+} // namespace
+
+PublishedAlready publishedAlready(CXDAVManager& store, const Preferences& preferences) {
+    const CXDAVAccount& account = store.account();
+    const Url base = account.baseLocationFor(account.user);
+    // In this order: the manager makes the own tree anew when its "info" is read and is not there.
+    const bool isThere = store.sanityCheckPublishStructureCreate(false) ||
+                         store.modDateForURL(base.cxURLByAppendingComponent(layout::kInfo));
+    if (!isThere) return {};
+    const auto info = store.dictionaryAtURL(base.cxURLByAppendingComponent(layout::kInfo), true, nullptr);
+    if (!info) return {};
+    const std::string serial = (*info)[kSerialNumber].string();
+    const bool isOurs = !serial.empty() && serial == knownSerial(preferences);
+    return {isOurs ? PublishedAlready::By::thisComputer : PublishedAlready::By::another,
+            store.modDateForURL(base.cxURLByAppendingComponent(layout::kDateFile))};
+}
+
+std::string publishedAlreadyText(const PublishedAlready& found) {
+    const std::string when = found.lastWrite ? fmt::format("; last written {}", found.lastWrite->toISO8601()) : "";
+    switch (found.by) {
+    case PublishedAlready::By::nobody: return "Nothing of this account is published yet.";
+    case PublishedAlready::By::thisComputer:
+        return fmt::format("Contacts of this account are published, from this computer{}.", when);
+    case PublishedAlready::By::another: break;
+    }
+    return fmt::format("Contacts of this account are published already, from another computer or another database{}. "
+                       "The store does not tell which one. Publish from one of them only.",
+                       when);
+}
+
+nlohmann::ordered_json publishedAlreadyJson(const PublishedAlready& found) {
+    using Json = nlohmann::ordered_json;
+    return {{"by", name(found.by)}, {"lastWrite", found.lastWrite ? Json(found.lastWrite->toISO8601()) : Json()}};
+}
+
+} // namespace rolvane::cli

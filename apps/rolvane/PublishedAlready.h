@@ -1,0 +1,28 @@
+#pragma once
+
+#include "Context.h"
+
+#include "foundation/Date.h"
+#include "foundation/Preferences.h"
+#include "store/dav/CXDAVManager.h"
+
+#include <optional>
+#include <string>
+
+namespace rolvane::cli {
+
+// Whether contacts of an account are on its store already, and who put them there. A store tells no computers' names: a
+// tree is this computer's when it bears the serial number that this database knows it by.
+struct PublishedAlready {
+    enum class By { nobody, thisComputer, another };
+    By by = By::nobody;
+    std::optional<Date> lastWrite; // by the store's clock
+};
+
+// Asks the account's store, which can be reached. Three requests at most; waits.
+PublishedAlready publishedAlready(CXDAVManager& store, const Preferences& preferences);
+
+std::string publishedAlreadyText(const PublishedAlready& found); // a sentence, or two
+nlohmann::ordered_json publishedAlreadyJson(const PublishedAlready& found);
+
+} // namespace rolvane::cli
