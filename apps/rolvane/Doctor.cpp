@@ -12,7 +12,7 @@
 #include "daemon/DaemonControl.h"
 #include "engine/pass/PassOutcome.h"
 #include "engine/recovery/DatabaseCare.h"
-#include "foundation/BusNotifications.h"
+#include "foundation/BusConnection.h"
 #include "foundation/Paths.h"
 #include "foundation/Preferences.h"
 #include "store/account/CertificateChain.h"
@@ -87,7 +87,8 @@ Finding Doctor::database() {
         return {"database", State::note, "There are no contacts yet.", "rolvane import FILE", {{"exists", false}}};
     }
     CXRolvane& database = _context.database();
-    const size_t people = database.countPeople(RemoteLocation("")), groups = database.listGroups(RemoteLocation("")).size();
+    const size_t people = database.countPeople(RemoteLocation("")),
+                 groups = database.listGroups(RemoteLocation("")).size();
     const Json figures{{"exists", true}, {"people", people}, {"groups", groups}};
     _databaseOpens = true;
     _sharesSomething = Publication(database).anything() || !subscriptionsToPeople(database).empty();
@@ -264,9 +265,9 @@ Finding Doctor::structure() {
 }
 
 Finding Doctor::otherComputers() {
-    const PublishedAlready found = publishedAlready(CXDAVManager::defaultManager(), Preferences::shared());
-    const bool another = found.by == PublishedAlready::By::another;
     const bool publishes = _databaseOpens && Publication(_context.database()).anything();
+    const PublishedAlready found = publishedAlready(CXDAVManager::defaultManager(), Preferences::shared(), publishes);
+    const bool another = found.by == PublishedAlready::By::another;
     return {"computers",
             another ? (publishes ? State::failed : State::note) : State::well,
             publishedAlreadyText(found),
@@ -284,7 +285,8 @@ void Doctor::examineSystem() {
 }
 
 Finding Doctor::bus() {
-    const bool connected = BusNotifications(_context.loop(), sessionBusAddress()).connected();
+    const auto address = sessionBusAddress();
+    const bool connected = address && connectBus(*address, std::chrono::seconds(5));
     return {"bus",
             connected ? State::well : State::note,
             connected

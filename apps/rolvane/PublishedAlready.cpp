@@ -4,6 +4,7 @@
 #include "conduits/store/StoreComparison.h"
 #include "engine/memory/EngineState.h"
 #include "engine/memory/StateRows.h"
+#include "engine/pass/PassOutcome.h"
 #include "model/PayloadKeys.h"
 #include "model/RemoteLocationMap.h"
 
@@ -16,10 +17,12 @@ namespace {
 // The serial number that the daemon knows the account's own tree by; "" for none.
 std::string knownSerial(const Preferences& preferences) {
     // The row that it would be stored in says where it stands.
-    const Dictionary itself{
-        {kConduitVaultra,
-         Dictionary{{kPriorState, Dictionary{{kSelf.str(), Dictionary{{std::string(kSerialNumber), ""}}}}}}}};
-    for (const auto& [row, value] : stateRows(itself))
+    Dictionary tree, users, conduit, all;
+    tree.set(kSerialNumber, std::string());
+    users.set(kSelf.str(), tree);
+    conduit.set(kPriorState, users);
+    all.set(kConduitVaultra, conduit);
+    for (const auto& [row, value] : stateRows(all))
         if (value.isString()) return preferences.get(kDaemonDomain, row).string();
     return {};
 }
@@ -35,7 +38,7 @@ const char* name(PublishedAlready::By by) {
 
 } // namespace
 
-PublishedAlready publishedAlready(CXDAVManager& store, const Preferences& preferences) {
+PublishedAlready publishedAlready(CXDAVManager& store, const Preferences& preferences, bool publishesHere) {
     const CXDAVAccount& account = store.account();
     const Url base = account.baseLocationFor(account.user);
     // In this order: the manager makes the own tree anew when its "info" is read and is not there.
@@ -45,7 +48,8 @@ PublishedAlready publishedAlready(CXDAVManager& store, const Preferences& prefer
     const auto info = store.dictionaryAtURL(base.cxURLByAppendingComponent(layout::kInfo), true, nullptr);
     if (!info) return {};
     const std::string serial = (*info)[kSerialNumber].string();
-    const bool isOurs = !serial.empty() && serial == knownSerial(preferences);
+    const std::string known = knownSerial(preferences);
+    const bool isOurs = known.empty() ? publishesHere && lastOutcome(preferences) : serial == known;
     return {isOurs ? PublishedAlready::By::thisComputer : PublishedAlready::By::another,
             store.modDateForURL(base.cxURLByAppendingComponent(layout::kDateFile))};
 }

@@ -19,8 +19,9 @@ struct PublishedAlready {
     std::optional<Date> lastWrite; // by the store's clock
 };
 
-// Asks the account's store, which can be reached. Three requests at most; waits.
-PublishedAlready publishedAlready(CXDAVManager& store, const Preferences& preferences);
+// Asks the account's store, which can be reached. Some requests; waits. The daemon learns the serial number when it
+// reads the own tree for the first time; until then what `publishesHere`, and had a pass, is taken for its own.
+PublishedAlready publishedAlready(CXDAVManager& store, const Preferences& preferences, bool publishesHere);
 
 std::string publishedAlreadyText(const PublishedAlready& found); // a sentence, or two
 nlohmann::ordered_json publishedAlreadyJson(const PublishedAlready& found);

@@ -3,6 +3,7 @@
 #include "AccountTrial.h"
 #include "FailureText.h"
 #include "ImportReport.h"
+#include "Publication.h"
 #include "Subscribe.h"
 #include "Subscriptions.h"
 
@@ -80,7 +81,10 @@ void Setup::chooseStore() {
     }
     if (!_options.invitation.empty()) return takeInvitation(_options.invitation);
     if (_options.here) {
-        _account.endpoint = "https://localhost/dav/{user}/Contacts"; // until the store says its port
+        const auto known = PrivateStore::savedOptions();
+        const bool wasStarted = known && PrivateStore(*known).status().port != 0;
+        _account.endpoint = wasStarted ? PrivateStore(*known).endpointTemplate()
+                                       : "https://localhost/dav/{user}/Contacts"; // until it has chosen a port
         return;
     }
     if (_options.endpoint.empty()) throw CommandError(kUsage, "The address is empty. Nothing was saved.");
@@ -127,7 +131,7 @@ void Setup::respectFormerAccount() {
     try {
         _former = CXDAVAccount::load();
         if (!_former) return;
-        const bool isSame = _former->user == _account.user && (_former->endpoint == _account.endpoint || _options.here);
+        const bool isSame = _former->user == _account.user && _former->endpoint == _account.endpoint;
         if (isSame) return;
         held = fmt::format("The account of {} at {} is set up here already.", _former->user.str(), _former->endpoint);
     } catch (const CXException& error) {
@@ -329,7 +333,8 @@ void Setup::makeOwnPassword() {
 void Setup::tryStoreOut() {
     if (!_wasTried) return;
     CXDAVManager& store = CXDAVManager::defaultManager();
-    _published = publishedAlready(store, (_context.database(), Preferences::shared()));
+    const bool publishes = Publication(_context.database()).anything();
+    _published = publishedAlready(store, Preferences::shared(), publishes);
     _trial = tryStore(store);
     if (_trial.hindrance) throw hinderedBy(*_trial.hindrance, kNothingSaved);
 }

@@ -45,8 +45,8 @@ TEST_F(TheDoctor, LooksAtEverything) {
     ASSERT_EQ(world.rolvane({"publish"}).status, kDone);
     const auto told = examine();
     EXPECT_EQ(told["well"], true) << told.dump(2);
-    for (const char* check : {"database", "preferences", "account", "address", "login", "authority", "clock",
-                              "rights", "webdav", "structure", "computers", "bus", "launcher", "queue"})
+    for (const char* check : {"database", "preferences", "account", "address", "login", "authority", "clock", "rights",
+                              "webdav", "structure", "computers", "bus", "launcher", "queue"})
         EXPECT_EQ(of(told, check)["state"], "well") << check << told.dump(2);
     EXPECT_NE(of(told, "unit")["state"], "missing");
     const Ran text = world.rolvane({"doctor"});
@@ -102,6 +102,8 @@ TEST_F(TheDoctor, NamesAnotherComputerThatHasPublished) {
     world.makeAccount();
     world.add("Ada");
     ASSERT_EQ(world.rolvane({"publish"}).status, kDone);
+    ASSERT_EQ(world.rolvane({"sync"}).status, kDone); // it learns the tree's number
+    EXPECT_EQ(of(examine(), "computers")["state"], "well");
     ASSERT_EQ(world.rolvane({"daemon", "stop"}).status, kDone);
     const std::string info = world.treeDirectory() + "/info";
     std::string text = readFile(info);

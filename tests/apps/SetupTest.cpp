@@ -2,6 +2,7 @@
 #include "Neighbour.h"
 #include "TerminalSession.h"
 
+#include "foundation/CXException.h"
 #include "foundation/Paths.h"
 #include "store/account/CertificateChain.h"
 #include "store/account/Invitation.h"
