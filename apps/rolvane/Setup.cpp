@@ -1,7 +1,6 @@
 #include "Setup.h"
 
 #include "AccountTrial.h"
-#include "FailureText.h"
 #include "ImportReport.h"
 #include "Publication.h"
 #include "Subscribe.h"
@@ -167,8 +166,9 @@ void Setup::trustAuthority() {
     if (!failure || isOfOnePassword(*failure)) return;
     if (failure->error != kCXDAVErrorSecureConnection || !_account.caFile.empty()) failWith(*failure);
     const FailureText text = failureText(*failure, sceneOfTheAccount(Clock::system().now()));
-    askToTrust(CommandError(
-        text.code, text.what + " Give the authority with --ca-file FILE or --fingerprint SHA-256. " + kNothingSaved));
+    askToTrust({text.code,
+                text.what + " Give the authority with --ca-file FILE or --fingerprint SHA-256. " + kNothingSaved,
+                {}});
     if (const auto still = reach({}); still && !isOfOnePassword(*still)) failWith(*still);
 }
 
@@ -199,14 +199,14 @@ void Setup::pin(const std::string& fingerprint) {
     writeFileDurably(_account.caFile, found->pem, 0600);
 }
 
-void Setup::askToTrust(const CommandError& why) {
-    if (!_questions.mayAsk()) throw why;
+void Setup::askToTrust(const FailureText& why) {
+    if (!_questions.mayAsk()) throw CommandError(why.code, why.what);
     const auto chain = certificatesShownAt(Url(_account.origins().back() + "/"));
     const ShownCertificate* authority = authorityOf(chain);
     _context.warn(fmt::format("This machine does not know the authority of the store's certificate, \"{}\".\nIts "
                               "SHA-256 fingerprint is\n  {}\nCompare it with the one that the store's owner tells you.",
                               authority->subject, authority->fingerprint));
-    if (!_questions.yes("Are they the same?", false)) throw why;
+    if (!_questions.yes("Are they the same?", false)) throw CommandError(why.code, why.what);
     pin(authority->fingerprint);
 }
 

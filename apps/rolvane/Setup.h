@@ -1,6 +1,7 @@
 #pragma once
 
 #include "Context.h"
+#include "FailureText.h"
 #include "PendingPassword.h"
 #include "PublishedAlready.h"
 #include "Questions.h"
@@ -43,7 +44,7 @@ private:
 
     void trustAuthority();
     void pin(const std::string& fingerprint);
-    void askToTrust(const CommandError& why);
+    void askToTrust(const FailureText& why);
     std::optional<PassFailure> reach(const PasswordSource& source);
 
     enum class Keep { source, file, keyring };

@@ -71,6 +71,7 @@ protected:
 };
 
 TEST_F(OwnPassword, CountsFromTheAnswerOnAndTheFormerOneNoMore) {
+    world.reset();
     const std::string given = readFile(world.store.stateDirectory() + "/conf/passwords");
     ASSERT_TRUE(signsIn("rita"));
     EXPECT_EQ(change("rita", "rita", "another long word"), 204);
