@@ -1,5 +1,6 @@
 #include "Doctor.h"
 #include "SetupCommands.h"
+#include "ValueNames.h"
 
 #include "foundation/Paths.h"
 
@@ -49,7 +50,8 @@ void addDoctorCommands(CLI::App& app, Context& context) {
         [&](CLI::App& c) {
             c.add_option("--bundle", *bundle,
                          "Write a report for whoever helps you to this file, without names, numbers, addresses or "
-                         "secrets");
+                         "secrets")
+                ->type_name(kFileValue);
         },
         [&context, bundle] { doctor(context, *bundle); });
 }
