@@ -236,6 +236,7 @@ void ApplyLoop::split() {
     const Dictionary now = withSubscriptions(underWay(outOfOrder));
     _underWay = underWayTogether(*_underWay, now);
     _end.removed = removedBy(outOfOrder);
+    _gatheringChanged = _parts.with.rolvane.hasUnsavedChanges();
     _parts.conduits.vaultra->willWrite(outOfOrder);
     _outOfOrder = std::make_unique<OutOfOrderWork>(_parts, std::move(outOfOrder));
     if (!now.empty()) noteUnderWay();
@@ -247,6 +248,8 @@ void ApplyLoop::noteUnderWay() {
     PassCommit commit(_parts.with.rolvane, _parts.with.preferences, _parts.state);
     claimState();
     _parts.state.setUnderWay(*_underWay);
+    // Access lists and removals that the store told of: with them goes what is known of them.
+    if (_gatheringChanged) _parts.state.putConduitDataWith(_parts.marksOfThePass);
     _parts.with.rolvane.save();
     commit.commit();
 }

@@ -85,6 +85,7 @@ private:
     CXDChangeRecords _pendingChanges;
     Dictionary _unsettled; // groups whose changes may have been lost, or applied in another order than they were made
     std::optional<Dictionary> _underWay; // none: the note of it was not read yet, and stays as it is
+    bool _gatheringChanged = false;      // something in the database that is not saved yet
     PassEnd _end;
     CXDChangeRecords _inOrder;
     size_t _inOrderDone = 0;
