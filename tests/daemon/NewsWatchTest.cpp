@@ -34,9 +34,7 @@ public:
         }
         now = until;
     }
-    void say(NewsLine::Kind kind, size_t tree = 0, const std::string& position = "p") {
-        listener.line({kind, tree, position});
-    }
+    void say(NewsLine::Kind kind, size_t tree = 0, const std::string& at = "p") { listener.line({kind, tree, at}); }
     void begin() { say(NewsLine::Kind::begin); }
     void end(int status, bool whole = false) {
         const auto told = listener; // it is replaced

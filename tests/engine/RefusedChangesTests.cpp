@@ -240,7 +240,7 @@ TEST_P(RefusedByOwnStore, TheOnlyContactThatIsRefusedAndDeletedLeavesNoName) {
     alice.loop.runOnce(0);
     afterTheRefusal();
     expectEverythingArrived(saved);
-    for (const std::string list : {std::string("AllCXGroup"), cxNormalizedUID(friends->uniqueId()).str()}) {
+    for (const std::string& list : {std::string("AllCXGroup"), cxNormalizedUID(friends->uniqueId()).str()}) {
         int code = 0;
         const auto state = alice.manager.dictionaryAtURL(
             alice.manager.account().baseLocationFor(UserName("alice")).cxURLByAppendingComponent(list), false, &code);
