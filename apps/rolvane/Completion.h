@@ -36,7 +36,7 @@ std::vector<Offer> offersOfTable(const CompletionPoint& point);
 struct ShellLine {
     std::vector<std::string> words; // without quotes; the last one may be empty
     char quote = 0;                 // that is open at the end, 0 for none
-    size_t kept = 0;                // bytes of the last word in front of what the shell's editor replaces
+    size_t kept = 0;                // bytes at the beginning of the last word that the editor keeps
 };
 // `breaks` holds the characters behind which the editor begins to replace.
 ShellLine shellLine(std::string_view line, std::string_view breaks);

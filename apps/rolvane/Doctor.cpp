@@ -363,7 +363,7 @@ Finding Doctor::queue() {
     return {"queue", oldest > kDay ? State::failed : State::note, what, "rolvane sync", figures};
 }
 
-// What is told -------------------------------------------------------------------------------------------------------
+// The report ---------------------------------------------------------------------------------------------------------
 
 bool allWell(const std::vector<Finding>& findings) {
     return std::none_of(findings.begin(), findings.end(), [](const Finding& f) { return f.state == State::failed; });

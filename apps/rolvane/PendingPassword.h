@@ -16,7 +16,7 @@ public:
     PendingPassword(const PendingPassword&) = delete;
     PendingPassword& operator=(const PendingPassword&) = delete;
 
-    // What an earlier run has left for the same account.
+    // The password that an earlier run has left for the same account.
     static std::optional<std::string> leftFor(const CXDAVAccount& account);
 
     void write(const std::string& password);

@@ -90,7 +90,7 @@ struct Preview {
     std::vector<CXGroupRef> groups;
 };
 
-// What the owner's tree holds for everybody who may read it.
+// The content of the owner's tree: every reader sees all of it.
 Preview published(CXRolvane& database) {
     const Publication publication(database);
     Preview preview;

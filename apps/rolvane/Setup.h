@@ -17,7 +17,7 @@
 
 namespace rolvane::cli {
 
-// What `rolvane setup` was told; each entry is the answer to one of its questions.
+// The options of `rolvane setup`; each one answers one of its questions.
 struct SetupOptions {
     std::string invitation, endpoint, user, caFile, fingerprint;
     std::string passwordCommand, passwordCredential, passwordFile;

@@ -125,7 +125,7 @@ CXRecordRef CardWriter::target(const ClientCard& card, const std::optional<Membe
     const CXRecordRef found = person ? person : group;
     if (now && (!found || found->uniqueId() != now->uid)) conflict(*now);
     if (!found) {
-        // Who was joined with somebody else is there: by the card of whoever remained.
+        // A person who was joined with another one lives on in that one's card.
         const auto joined = card.entity.isGroup ? std::nullopt : _memory.joinedAs(vcardMemberKey(card.entity.uid));
         if (joined && isShared == cxIsSubscribed(*joined) && _rolvane.recordForUniqueId(*joined))
             conflict(_memory.of(_c.book.id, *joined).value_or(Member{*joined, _c.name, {}}));

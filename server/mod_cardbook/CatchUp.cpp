@@ -97,7 +97,7 @@ private:
         return books;
     }
 
-    // Whoever has gone is found by nobody: the line may stay.
+    // The line may stay when the person is deleted: nobody looks it up then.
     void noteJoined(const CXRow& row) {
         const std::string_view bytes(reinterpret_cast<const char*>(row.encoded->data()), row.encoded->size());
         std::vector<std::string> keys;

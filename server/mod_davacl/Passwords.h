@@ -13,8 +13,8 @@ namespace rolvane::davacl {
 void registerPasswords(apr_pool_t* pool);
 // Makes the memory that the server's processes will share. A complaint, or null.
 const char* preparePasswords(apr_pool_t* pool);
-// What the user file has of the user at this moment: another text when the password is another one. Nothing where there
-// is no file or no such line.
+// The user's line in the user file at this moment. It differs when the password has been changed. Nothing where the
+// file or the line is missing.
 std::optional<std::string> passwordLineOf(const request_rec* r, const std::string& user);
 
 } // namespace rolvane::davacl

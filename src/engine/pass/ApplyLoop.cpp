@@ -248,13 +248,13 @@ void ApplyLoop::noteUnderWay() {
     PassCommit commit(_parts.with.rolvane, _parts.with.preferences, _parts.state);
     claimState();
     _parts.state.setUnderWay(*_underWay);
-    // Access lists and removals that the store told of: with them goes what is known of them.
+    // Access lists and removals that came from the store are saved together with the states that know them.
     if (_gatheringChanged) _parts.state.putConduitDataWith(_parts.marksOfThePass);
     _parts.with.rolvane.save();
     commit.commit();
 }
 
-// Whose contacts the database has: the user's own, and those that a subscription brought, the same since.
+// The database has contacts of these users: of its own one, and of those whose subscription has not been replaced.
 std::function<bool(const UserName&)> ApplyLoop::hasCopies() const {
     std::unordered_set<UserName> users{kSelf};
     for (const CXSubscriptionRef& subscription : _parts.with.rolvane.subscriptions()) {
@@ -265,7 +265,8 @@ std::function<bool(const UserName&)> ApplyLoop::hasCopies() const {
     return [users = std::move(users)](const UserName& user) { return users.contains(user); };
 }
 
-// By which the trees of others are read now: copies of a former one are gone, and nobody has removed them.
+// Adds the present subscription to each tree of somebody else. Copies of a former subscription are gone, though nobody
+// has deleted them.
 Dictionary ApplyLoop::withSubscriptions(Dictionary underWay) const {
     for (const auto& [user, subscription] : subscriptionsOf(underWay))
         underWay.dictionaryFor(user.str()).set(kSubscription, subscription->uniqueId());

@@ -92,7 +92,7 @@ public:
         _gone.insert(uid.str());
     }
 
-    // Gives what of it cannot be settled before the tree is read.
+    // Gives the part that has to wait until the tree is read.
     Dictionary group(const UniqueId& uid, const Dictionary& touched) {
         Dictionary left;
         if (_withdrawn.contains(uid)) return left; // and a change beside that would be folded into one that is none
@@ -117,7 +117,7 @@ public:
             left.set(kNames, touched[kNames]);
             return left;
         }
-        // Another name than those comes from somebody else.
+        // A name that the pass did not write comes from somebody else.
         const auto name = _namesThere.find(uid.str());
         if (name == _namesThere.end() || name->second == Value(there->name()) ||
             !touched[kNames].array().contains(name->second))
