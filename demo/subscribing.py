@@ -134,7 +134,7 @@ def tree(view):
 def unsubscription(owner, subscriber, view):
     """Ends a subscription that may write, and begins it again: nothing of it is carried to the owner's tree."""
     before = tree(view)
-    talk(subscriber, "unsubscribe", owner.name)
+    talk(subscriber, "unsubscribe", owner.name, "--yes")
     left = [r for r in subscriber.json("list") + subscriber.json("group", "list") if r["owner"]]
     subscriber.run("sync")
     owner.run("sync")
@@ -213,7 +213,7 @@ def subscription(world, owner, endpoint, authority):
         talk(owner, "share", subscriber.name)
         talk(subscriber, "subscribe", owner.name)
         check_copies(owner, subscriber, "subscribed once more")
-        notice = withdrawal(owner, subscriber, lambda: talk(owner, "unpublish"))
+        notice = withdrawal(owner, subscriber, lambda: talk(owner, "unpublish", "--yes"))
         taken_back(subscriber, notice)
     with Step("A third user, never granted anything"):
         code, _ = talk(stranger, "subscribe", owner.name, may=(3, 5))

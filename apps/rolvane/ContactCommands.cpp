@@ -1,3 +1,4 @@
+#include "Consent.h"
 #include "Context.h"
 #include "Counted.h"
 #include "ImportReport.h"
@@ -5,6 +6,8 @@
 #include "PersonFields.h"
 #include "RecordJson.h"
 #include "SafeText.h"
+#include "Shares.h"
+#include "Shown.h"
 #include "Subscriptions.h"
 #include "ValueNames.h"
 
@@ -286,29 +289,41 @@ void edit(Context& context, const std::string& name, const PersonFields& fields)
     tell(context, *person, changed ? "changed" : "stays as it was");
 }
 
-bool confirmed(Context& context, const std::string& question) {
-    if (!::isatty(STDIN_FILENO)) return true;
-    std::cerr << shownLine(question) << " [y/N] " << std::flush;
-    std::string answer;
-    std::getline(std::cin, answer);
-    if (answer == "y" || answer == "Y" || answer == "yes") return true;
-    context.say("Nothing was deleted.");
-    return false;
+// "Delete 1 person (Ada Miller)? 2 users who read your contacts lose it, too."
+std::string deletionOf(CXRolvane& database, const std::vector<CXPersonRef>& people) {
+    std::set<UniqueId> own;
+    std::set<std::string> publishers;
+    for (const CXPersonRef& person : people)
+        if (person->isSubscribed())
+            publishers.insert(publisherOf(person->remoteLocation()));
+        else
+            own.insert(person->uniqueId());
+    std::string question = fmt::format("Delete {}{}?", counted(people.size(), "person", "people"),
+                                       people.size() == 1 ? fmt::format(" ({})", people[0]->displayName()) : "");
+    for (const std::string& publisher : publishers)
+        question += fmt::format(" {} loses what you delete of theirs, too.", publisher);
+    const Shown shown = shownToReaders(database);
+    const bool seen =
+        std::any_of(own.begin(), own.end(), [&](const UniqueId& uid) { return shown.people.contains(uid); });
+    if (const size_t readers = Shares(database).readers().size(); seen && readers > 0)
+        question += fmt::format(" {} your contacts {} it, too.", counted(readers, "user who reads", "users who read"),
+                                readers == 1 ? "loses" : "lose");
+    return question;
 }
 
 void remove(Context& context, const std::vector<std::string>& names, bool yes) {
     CXRolvane& database = context.database();
     std::vector<CXPersonRef> people;
     for (const std::string& name : names) {
-        people.push_back(findPerson(database, name, true));
-        requireWritable(*people.back());
+        const CXPersonRef person = findPerson(database, name, true);
+        requireWritable(*person);
+        const auto same = [&](const CXPersonRef& other) { return other->uniqueId() == person->uniqueId(); };
+        if (std::none_of(people.begin(), people.end(), same)) people.push_back(person);
     }
-    const std::string question = people.size() == 1 ? fmt::format("Delete {}?", people[0]->displayName())
-                                                    : fmt::format("Delete {} people?", people.size());
-    if (!yes && !confirmed(context, question)) return;
+    requireConsent(context, yes, deletionOf(database, people), "Nothing was deleted.");
     for (const CXPersonRef& person : people) database.removeRecord(person);
     database.save();
-    context.say(people.size() == 1 ? "1 person deleted." : fmt::format("{} people deleted.", people.size()));
+    context.say(counted(people.size(), "person", "people") + " deleted.");
 }
 
 } // namespace
@@ -413,7 +428,7 @@ void addContactCommands(CLI::App& app, Context& context) {
         app, context, "delete", "Delete people; a part of a name is not enough",
         [&](CLI::App& command) {
             command.add_option("names", *deleted, "Names or identifiers")->required()->type_name(kPersonValue);
-            command.add_flag("-y,--yes", *yes, "Do not ask");
+            declareConsent(command, *yes);
         },
         [&context, deleted, yes] { remove(context, *deleted, *yes); });
 }

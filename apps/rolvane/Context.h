@@ -16,11 +16,12 @@ namespace rolvane::cli {
 // Exit codes, the same for every command; `rolvane --help` lists them.
 enum ExitCode : int {
     kOk = 0,
-    kFailed = 1,      // it could not be done; the message says why
-    kUsage = 2,       // the command line is wrong
-    kNotFound = 3,    // what was named does not exist, or the name fits several
-    kPartly = 4,      // some of the input was taken and some refused; each refusal is named
-    kRefused = 5,     // not allowed: a read-only copy, a wrong password, no right on the store
+    kFailed = 1,   // it could not be done; the message says why
+    kUsage = 2,    // the command line is wrong
+    kNotFound = 3, // what was named does not exist, or the name fits several
+    kPartly = 4,   // some of the input was taken and some refused; each refusal is named
+    kRefused =
+        5, // not allowed: a read-only copy, a wrong password, no right on the store, a question not answered with yes
     kUnreachable = 6, // the store or the daemon could not be reached in time
 };
 

@@ -54,7 +54,8 @@ const std::map<std::string, const char*>& examples() {
         {"publish", "  rolvane publish\n"
                     "  rolvane publish --group Family"},
         {"unpublish", "  rolvane unpublish --group Family\n"
-                      "  rolvane unpublish --keep"},
+                      "  rolvane unpublish --keep\n"
+                      "  rolvane unpublish --yes --forget-shares"},
         {"share", "  rolvane share bob\n"
                   "  rolvane share carol --write"},
         {"unshare", "  rolvane unshare bob"},

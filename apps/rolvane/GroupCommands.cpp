@@ -1,4 +1,6 @@
+#include "Consent.h"
 #include "Context.h"
+#include "Counted.h"
 #include "Lookup.h"
 #include "Publication.h"
 #include "RecordJson.h"
@@ -103,6 +105,10 @@ void deleteGroup(Context& context, const GroupOptions& options) {
         throw CommandError(kRefused, fmt::format("\"{}\" is published by itself. Withdraw it first, with `rolvane "
                                                  "unpublish --group`: its files would stay on the store.",
                                                  name));
+    requireConsent(context, options.yes,
+                   fmt::format("Delete the group \"{}\" with {}? The members stay.", name,
+                               counted(group->memberCount(), "member", "members")),
+                   "Nothing was deleted.");
     context.database().removeRecord(group);
     context.database().save();
     context.say(fmt::format("The group \"{}\" is deleted; its members stay.", name));
@@ -208,8 +214,9 @@ void addGroupCommands(CLI::App& app, Context& context) {
         "rename", "Give a group another name",
         [o](CLI::App& c) { c.add_option("name", o->name, "The new name")->required(); },
         [&context, o] { renameGroup(context, *o); });
-    with("delete", "Delete a group; its members stay, and a part of its name is not enough", nullptr,
-         [&context, o] { deleteGroup(context, *o); });
+    with(
+        "delete", "Delete a group; its members stay, and a part of its name is not enough",
+        [o](CLI::App& c) { declareConsent(c, o->yes); }, [&context, o] { deleteGroup(context, *o); });
     with("add", "Make people members", people, [&context, o] { changeMembers(context, *o, true); });
     with("remove", "Take members out", people, [&context, o] { changeMembers(context, *o, false); });
     with("add-group", "Put groups into a group", groups, [&context, o] { changeSubgroups(context, *o, true); });

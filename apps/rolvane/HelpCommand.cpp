@@ -90,7 +90,8 @@ const std::vector<ExitCodeText>& exitCodeTexts() {
         {kUsage, "wrong command line"},
         {kNotFound, "no such thing, or several of that name"},
         {kPartly, "part of the input was taken and part refused; each refusal is named"},
-        {kRefused, "not allowed: a read-only copy, a wrong password, no right on the store"},
+        {kRefused,
+         "not allowed: a read-only copy, a wrong password, no right on the store, a question not answered with yes"},
         {kUnreachable, "the store or the daemon was not reached in time"},
     };
     return all;

@@ -81,10 +81,7 @@ bool Publication::publishGroup(const CXGroupRef& group, const Url& base) {
 
 bool Publication::withdrawEverything() {
     if (!everything()) return false;
-    const CXAllGroupRef all = _database.allGroup();
-    for (const char* property : {kCXRemoteLocationProperty, kCXReadSharingACLProperty, kCXReadWriteSharingACLProperty,
-                                 kCXReadSharingDatesProperty, kCXReadWriteSharingDatesProperty})
-        all->removeValueForProperty(property);
+    _database.allGroup()->removeValueForProperty(kCXRemoteLocationProperty);
     settle();
     return true;
 }

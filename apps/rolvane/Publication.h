@@ -30,6 +30,7 @@ public:
     // Each is unsaved. True when it changed something.
     bool publishEverything(const Url& base);
     bool publishGroup(const CXGroupRef& group, const Url& base);
+    // With whom the owner shares stays known, for the next publication.
     bool withdrawEverything(); // groups that are published by themselves stay so
     bool withdrawGroup(const CXGroupRef& group);
 

@@ -6,6 +6,7 @@
 #include "RecordJson.h"
 #include "SafeText.h"
 #include "Shares.h"
+#include "Shown.h"
 #include "Subscriptions.h"
 #include "ValueNames.h"
 
@@ -85,27 +86,16 @@ void who(Context& context, const std::string& named) {
                                 listed(through)));
 }
 
+// The content of the owner's tree: every reader sees all of it.
 struct Preview {
     std::vector<CXListing> people;
     std::vector<CXGroupRef> groups;
 };
 
-// The content of the owner's tree: every reader sees all of it.
 Preview published(CXRolvane& database) {
-    const Publication publication(database);
-    Preview preview;
-    preview.people = database.listPeople(RemoteLocation(""));
-    if (publication.everything()) {
-        for (const CXListing& listing : database.listGroups(RemoteLocation("")))
-            if (auto group = std::dynamic_pointer_cast<CXGroup>(database.recordForUniqueId(listing.uniqueId)))
-                preview.groups.push_back(std::move(group));
-        return preview;
-    }
-    preview.groups = publication.groups();
-    std::set<UniqueId> members;
-    for (const CXGroupRef& group : preview.groups)
-        for (const UniqueId& uid : group->memberUniqueIds()) members.insert(uid);
-    std::erase_if(preview.people, [&](const CXListing& listing) { return !members.contains(listing.uniqueId); });
+    Shown shown = shownToReaders(database);
+    Preview preview{database.listPeople(RemoteLocation("")), std::move(shown.groups)};
+    std::erase_if(preview.people, [&](const CXListing& listing) { return !shown.people.contains(listing.uniqueId); });
     return preview;
 }
 

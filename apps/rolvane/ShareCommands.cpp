@@ -163,6 +163,13 @@ void changeShares(Context& context, const ShareOptions& options, bool grant) {
                                                       "you do.",
                                                       user));
     }
+    if (!Publication(database).anything()) { // the store has nothing of it: the right was kept for a next publication
+        shares.deny(user);
+        database.save();
+        context.say(fmt::format("\"{}\" will not read what you publish next.", user));
+        if (context.json) context.print({{"user", user}, {"rights", nullptr}, {"pass", nullptr}});
+        return;
+    }
     requireAccessLists(base, user);
 
     const std::vector<std::string> writers = shares.writers();

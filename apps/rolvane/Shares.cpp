@@ -109,6 +109,10 @@ bool Shares::deny(const std::string& user) {
     return reads || writes;
 }
 
+void Shares::denyAll() {
+    for (const std::string& user : readers()) deny(user);
+}
+
 void Shares::settle() {
     const Publication publication(_database);
     if (publication.everything()) return;

@@ -32,6 +32,7 @@ public:
     // Each is unsaved. True when it changed something.
     bool grant(const std::string& user, bool write); // without `write` a writer becomes a reader
     bool deny(const std::string& user);
+    void denyAll();
     // The two properties on every published group, where they are wanted there.
     void settle();
 

@@ -1,10 +1,14 @@
+#include "Consent.h"
 #include "Context.h"
+#include "Counted.h"
 #include "FailureText.h"
 #include "LeftOnStore.h"
 #include "Lookup.h"
 #include "PassReport.h"
 #include "Passes.h"
 #include "Publication.h"
+#include "Shares.h"
+#include "Shown.h"
 #include "ValueNames.h"
 
 #include "daemon/DaemonControl.h"
@@ -19,7 +23,7 @@ namespace {
 
 struct PublishOptions {
     std::string group;
-    bool noWait = false, noDaemon = false, keep = false;
+    bool noWait = false, noDaemon = false, keep = false, forgetShares = false, yes = false;
     double timeout = kPassSeconds;
 };
 
@@ -53,6 +57,34 @@ void removeWhatIsLeft(CXRolvane& database, const Url& base) {
     });
 }
 
+// "bob", "bob and cid", "bob, cid and 2 others".
+std::string namedUsers(const std::vector<std::string>& users) {
+    constexpr size_t kMost = 3;
+    const size_t named = users.size() <= kMost ? users.size() : kMost - 1;
+    std::string text;
+    for (size_t i = 0; i < named; i++) text += (i == 0 ? "" : i + 1 == users.size() ? " and " : ", ") + users[i];
+    return named == users.size() ? text : fmt::format("{} and {} others", text, users.size() - named);
+}
+
+// People that somebody gets to see who has not seen them before, of whom there is a question first.
+void askAboutReaders(Context& context, const PublishOptions& options, const CXGroupRef& group, const Url& base) {
+    CXRolvane& database = context.database();
+    const std::vector<std::string> readers = Shares(database).readers();
+    if (readers.empty()) return;
+    Publication publication(database);
+    const Shown before = shownToReaders(database);
+    group ? publication.publishGroup(group, base) : publication.publishEverything(base);
+    const Shown more = without(shownToReaders(database), before);
+    database.rollback();
+    if (more.empty()) return;
+    requireConsent(context, options.yes,
+                   fmt::format("Publish {}? {} {} readable for {} ({}).",
+                               group ? fmt::format("the group \"{}\"", group->name()) : "all contacts", more.amount(),
+                               more.isOne() ? "becomes" : "become", counted(readers.size(), "user", "users"),
+                               namedUsers(readers)),
+                   "Nothing was published.");
+}
+
 void publish(Context& context, const PublishOptions& options) {
     const Url base = ownBase();
     CXRolvane& database = context.database();
@@ -66,10 +98,11 @@ void publish(Context& context, const PublishOptions& options) {
     } else if (!served) {
         requireUsableStore("Nothing was published.");
     }
+    const CXGroupRef group = options.group.empty() ? nullptr : findGroup(database, options.group);
+    askAboutReaders(context, options, group, base);
     removeWhatIsLeft(database, base);
 
     PassWatch watch(context, !context.quiet);
-    const CXGroupRef group = options.group.empty() ? nullptr : findGroup(database, options.group);
     const bool changed = group ? publication.publishGroup(group, base) : publication.publishEverything(base);
     database.save();
     const int64_t position = database.journalPosition();
@@ -92,11 +125,15 @@ void publish(Context& context, const PublishOptions& options) {
     if (context.json) context.print(outcomeJson(outcome));
 }
 
+void withdrawAll(Publication& publication) {
+    publication.withdrawEverything();
+    for (const CXGroupRef& single : publication.groups()) publication.withdrawGroup(single);
+}
+
 // What is withdrawn, as the beginning of a sentence.
 std::string withdraw(Publication& publication, LeftOnStore& left, const CXGroupRef& group) {
     if (!group) {
-        publication.withdrawEverything();
-        for (const CXGroupRef& single : publication.groups()) publication.withdrawGroup(single);
+        withdrawAll(publication);
         return "Nothing is published any more";
     }
     const bool wasLeft = left.isLeft(group->uniqueId());
@@ -113,6 +150,7 @@ void unpublishAtRest(Context& context, const PublishOptions& options, const CXGr
     const auto people = group ? publication.peopleOnlyIn(group) : std::vector<UniqueId>{};
     const bool isNews = group && publication.publishes(group);
     const std::string done = withdraw(publication, left, group);
+    if (options.forgetShares && !publication.anything()) Shares(database).denyAll();
     const bool wholeListStays = group && publication.everything();
     const bool nothingLeft = !publication.anything();
     const bool removes = !options.keep && !wholeListStays;
@@ -140,9 +178,36 @@ void unpublishAtRest(Context& context, const PublishOptions& options, const CXGr
                                        : "."));
 }
 
+// Asks before anything leaves the store, and anybody's database with it.
+void askAboutWithdrawal(Context& context, const PublishOptions& options, const CXGroupRef& group) {
+    CXRolvane& database = context.database();
+    Publication publication(database);
+    const Shown before = shownToReaders(database);
+    if (before.groups.empty() && !publication.everything()) return; // nothing is published
+    if (group && !publication.publishes(group)) return;
+    if (group)
+        publication.withdrawGroup(group);
+    else
+        withdrawAll(publication);
+    const Shown gone = without(before, shownToReaders(database));
+    database.rollback();
+    if (group && gone.empty()) return; // it stays as a part of the contact list
+    const std::vector<std::string> readers = Shares(database).readers();
+    const char* verb = options.keep ? (readers.size() == 1 ? "gets no more news of" : "get no more news of")
+                                    : (readers.size() == 1 ? "loses" : "lose");
+    requireConsent(context, options.yes,
+                   fmt::format("{} {}? {}{}.", options.keep ? "Stop publishing" : "Take off the store", gone.amount(),
+                               readers.empty() ? "You share with nobody"
+                                               : fmt::format("{} ({}) {} {}", counted(readers.size(), "user", "users"),
+                                                             namedUsers(readers), verb, gone.isOne() ? "it" : "them"),
+                               options.keep ? "; the files stay there" : ""),
+                   "Everything is still published.");
+}
+
 void unpublish(Context& context, const PublishOptions& options) {
     ownBase(); // there is an account
     const CXGroupRef group = options.group.empty() ? nullptr : findGroup(context.database(), options.group);
+    askAboutWithdrawal(context, options, group);
     whileDaemonRests([&] { unpublishAtRest(context, options, group); }); // nothing is written behind our back
 }
 
@@ -155,6 +220,7 @@ void addSharingCommands(CLI::App& app, Context& context) {
         [&](CLI::App& command) {
             command.add_option("-g,--group", options->group, "Publish this group only (name or identifier)")
                 ->type_name(kGroupValue);
+            declareConsent(command, options->yes);
             command.add_flag("--no-wait", options->noWait, "Return as soon as the daemon is at work");
             command.add_flag("--no-daemon", options->noDaemon, "Only note it; do not start the daemon");
             command.add_option("--timeout", options->timeout, "Seconds to wait for the pass")
@@ -168,6 +234,10 @@ void addSharingCommands(CLI::App& app, Context& context) {
             command.add_option("-g,--group", options->group, "Withdraw this group only (name or identifier)")
                 ->type_name(kGroupValue);
             command.add_flag("--keep", options->keep, "Leave the files on the store");
+            command.add_flag("--forget-shares", options->forgetShares,
+                             "Forget with whom you share, too, when nothing stays published; without it, the next "
+                             "publication is shared with the same users");
+            declareConsent(command, options->yes);
         },
         [&context, options] { unpublish(context, *options); });
     const auto seconds = std::make_shared<double>(kPassSeconds);

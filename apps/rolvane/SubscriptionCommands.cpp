@@ -1,4 +1,6 @@
+#include "Consent.h"
 #include "Context.h"
+#include "Counted.h"
 #include "FailureText.h"
 #include "PassReport.h"
 #include "Passes.h"
@@ -32,10 +34,6 @@ struct SubscribeOptions {
     bool noWait = false, noDaemon = false;
     double timeout = kPassSeconds;
 };
-
-std::string counted(size_t count, const char* one, const char* several) {
-    return fmt::format("{} {}", count, count == 1 ? one : several);
-}
 
 // Asks the store whether there is something that may be read, and says clearly why not.
 void requirePublication(const RemoteLocation& location) {
@@ -79,8 +77,8 @@ Json described(CXRolvane& database, const CXSubscriptionRef& subscription) {
 }
 
 std::string amount(const Json& subscription) {
-    return counted(subscription["people"], "person", "people") + " and " +
-           counted(subscription["groups"], "group", "groups");
+    return counted(subscription["people"].get<size_t>(), "person", "people") + " and " +
+           counted(subscription["groups"].get<size_t>(), "group", "groups");
 }
 
 // subscribe --------------------------------------------------------------------------------------------------------
@@ -156,12 +154,20 @@ void subscribe(Context& context, const SubscribeOptions& options) {
 
 // One save takes the subscription and all that came by it away. The daemon rests meanwhile, and what it remembers of
 // the publisher goes before it starts again: nothing of this is an edit that would be carried to the publisher's store.
-void unsubscribe(Context& context, const std::string& named) {
+void unsubscribe(Context& context, const std::string& named, bool yes) {
     CXRolvane& database = context.database();
     const CXSubscriptionRef subscription = findSubscription(database, named);
     const RemoteLocation location = subscription->remoteLocation();
+    const size_t unsent = unsentTo(database, Preferences::shared(), location);
+    if (unsent > 0)
+        requireConsent(context, yes,
+                       fmt::format("Unsubscribe from \"{}\"? {} of yours {} not been sent yet, and {} dropped.",
+                                   publisherOf(location), counted(unsent, "change", "changes"),
+                                   unsent == 1 ? "has" : "have", unsent == 1 ? "is" : "are"),
+                       "You are still subscribed.");
     const DaemonControl daemon;
     const bool ran = daemon.stop();
+    const size_t lost = unsentTo(database, Preferences::shared(), location);
     const Json data = described(database, subscription);
     try {
         const UniqueId identifier = subscription->uniqueId();
@@ -177,7 +183,7 @@ void unsubscribe(Context& context, const std::string& named) {
     if (context.json) context.print(data);
     context.say(fmt::format("You are no longer subscribed to \"{}\"; {} left with it.", data["user"].get<std::string>(),
                             amount(data)));
-    if (const size_t lost = data["pending"]; lost > 0)
+    if (lost > 0)
         context.warn(fmt::format("{} of yours had not been sent yet and {} dropped.",
                                  counted(lost, "change", "changes"), lost == 1 ? "is" : "are"));
 }
@@ -224,12 +230,14 @@ void addSubscriptionCommands(CLI::App& app, Context& context) {
         },
         [&context, options] { subscribe(context, *options); });
     const auto named = std::make_shared<std::string>();
+    const auto yes = std::make_shared<bool>(false);
     addCommand(
         app, context, "unsubscribe", "End a subscription; what came by it leaves this database",
         [&](CLI::App& command) {
             command.add_option("user", *named, "User name or location")->required()->type_name(kPublisherValue);
+            declareConsent(command, *yes);
         },
-        [&context, named] { unsubscribe(context, *named); });
+        [&context, named, yes] { unsubscribe(context, *named, *yes); });
     addCommand(app, context, "subscriptions", "List the subscriptions: whose, how much, and what you may do", nullptr,
                [&context] { listSubscriptions(context); });
 }

@@ -5,12 +5,14 @@
 #include "ValueNames.h"
 
 #include "conduits/PublishedLayout.h"
+#include "contacts/records/Identifier.h"
 #include "engine/memory/EngineState.h"
 #include "model/RemoteLocationMap.h"
 #include "store/dav/CXDAVManager.h"
 
 #include <algorithm>
 #include <fmt/format.h>
+#include <set>
 
 namespace rolvane::cli {
 
@@ -115,6 +117,19 @@ size_t pendingFor(Preferences& preferences, const RemoteLocation& location) {
     return static_cast<size_t>(std::count_if(waiting.begin(), waiting.end(), [&](const CXDChangeRecordPtr& record) {
         return record->user() == user && (record->appliesToSources() & CXDSyncSourceVaultra) != 0;
     }));
+}
+
+size_t unsentTo(CXRolvane& database, Preferences& preferences, const RemoteLocation& location) {
+    const UserName user(publisherOf(location));
+    std::set<UniqueId> waiting;
+    for (const CXDChangeRecordPtr& record : EngineState(preferences).getPendingChanges())
+        if (record->user() == user && record->person()) waiting.insert(*record->person());
+    size_t unsent = pendingFor(preferences, location);
+    for (const UniqueId& uid : database.editedSinceCommon())
+        if (const auto row = database.personRow(uid);
+            row && row->location == location && !waiting.contains(cxNormalizedUID(row->sharingUniqueId)))
+            unsent++;
+    return unsent;
 }
 
 void forgetSubscription(Preferences& preferences, const RemoteLocation& location, const UniqueId& subscription) {

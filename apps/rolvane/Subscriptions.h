@@ -45,6 +45,8 @@ std::optional<RemoteLocation> locationOf(CXRolvane& database, const Whose& whose
 bool wasRead(Preferences& preferences, const RemoteLocation& location);
 // Changes that wait to be sent to that publisher.
 size_t pendingFor(Preferences& preferences, const RemoteLocation& location);
+// The same with edits of that publisher's people that no pass has met yet.
+size_t unsentTo(CXRolvane& database, Preferences& preferences, const RemoteLocation& location);
 // Forgets the publisher's data and the changes that wait for it. Only while no daemon runs.
 void forgetSubscription(Preferences& preferences, const RemoteLocation& location, const UniqueId& subscription);
 

@@ -1,3 +1,4 @@
+#include "Consent.h"
 #include "Context.h"
 #include "Counted.h"
 #include "ImportReport.h"
@@ -46,10 +47,16 @@ void importWithdrawn(Context& context, const std::string& named) {
     reportImport(context, VCardImport::importFile(context.database(), record.file), 0);
 }
 
-void forgetWithdrawn(Context& context, const std::string& named) {
+void forgetWithdrawn(Context& context, const std::string& named, bool yes) {
     const WithdrawnContacts record = findWithdrawn(named);
+    if (!record.file.empty())
+        requireConsent(context, yes,
+                       fmt::format("Delete what is kept of {}, {} and {}? There is no other copy here.",
+                                   record.user.str(), counted(record.people, "person", "people"),
+                                   counted(record.groups, "group", "groups")),
+                       "Nothing was deleted.");
     WithdrawnContactsFolder().forget(record);
-    context.say(fmt::format("{} is forgotten, with {} people.", record.name, record.people));
+    context.say(fmt::format("{} is forgotten, with {}.", record.name, counted(record.people, "person", "people")));
 }
 
 } // namespace
@@ -89,8 +96,14 @@ void addWithdrawnCommands(CLI::App& app, Context& context) {
                [&context] { listWithdrawn(context); });
     addCommand(*withdrawn, context, "import", "Take kept contacts as your own", name,
                [&context, named] { importWithdrawn(context, *named); });
-    addCommand(*withdrawn, context, "forget", "Delete what is kept", name,
-               [&context, named] { forgetWithdrawn(context, *named); });
+    const auto yes = std::make_shared<bool>(false);
+    addCommand(
+        *withdrawn, context, "forget", "Delete what is kept",
+        [name, yes](CLI::App& command) {
+            name(command);
+            declareConsent(command, *yes);
+        },
+        [&context, named, yes] { forgetWithdrawn(context, *named, *yes); });
 }
 
 } // namespace rolvane::cli

@@ -28,7 +28,7 @@ TEST_F(Account, WithoutOneEveryCommandThatNeedsItSaysSo) {
     EXPECT_TRUE(saysOnce(world.rolvane({"account", "show"}), kNoSuchThing, "rolvane account set"));
     EXPECT_TRUE(saysOnce(test(), kNoSuchThing, "rolvane account set"));
     EXPECT_TRUE(saysOnce(world.rolvane({"publish"}), kNoSuchThing, "rolvane account set"));
-    EXPECT_TRUE(saysOnce(world.rolvane({"unpublish"}), kNoSuchThing, "rolvane account set"));
+    EXPECT_TRUE(saysOnce(world.rolvane({"unpublish", "--yes"}), kNoSuchThing, "rolvane account set"));
     EXPECT_TRUE(saysOnce(set({"--endpoint", "https://dav.example.org/{user}/Contacts"}), kWrongLine, "--user"));
 }
 

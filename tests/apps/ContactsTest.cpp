@@ -144,7 +144,7 @@ TEST_F(Contacts, GroupsAreMadeFilledNestedRenamedAndDeleted) {
     shown = world.json({"group", "show", family});
     EXPECT_EQ(shown["name"], "Kin – 家族");
     EXPECT_EQ(shown["members"], nlohmann::json{bob});
-    world.done({"group", "delete", "Cousins"});
+    world.done({"group", "delete", "Cousins", "--yes"});
     EXPECT_EQ(world.json({"group", "list"}).size(), 1U);
     EXPECT_EQ(world.json({"list"}).size(), 2U) << "the members stay";
 }
@@ -159,7 +159,7 @@ TEST_F(Contacts, GroupCommandsRefuseWhatMakesNoSense) {
     EXPECT_TRUE(saysOnce(world.rolvane({"group", "add", "Family", "Nobody"}), kNoSuchThing, "Nobody"));
     EXPECT_TRUE(saysOnce(world.rolvane({"group", "show", "Nowhere"}), kNoSuchThing, "Nowhere"));
     EXPECT_TRUE(saysOnce(world.rolvane({"group", "rename", "Family", ""}), kWrongLine, "name"));
-    EXPECT_TRUE(saysOnce(world.rolvane({"group", "delete", "Fam"}), kNoSuchThing, "Fam"));
+    EXPECT_TRUE(saysOnce(world.rolvane({"group", "delete", "Fam", "--yes"}), kNoSuchThing, "Fam"));
     const Ran ring = world.rolvane({"group", "add-group", "Cousins", "Family"});
     EXPECT_EQ(ring.status, kFailure) << ring;
     EXPECT_NE(ring.errors.find("contain itself"), std::string::npos) << ring;

@@ -39,9 +39,9 @@ protected:
         EXPECT_EQ(world.json({"list", "--of", "bob"}).size(), 1U);
         world.done({"unshare", "bob"});
         world.done({"unsubscribe", "bob"});
-        world.done({"unpublish", "--group", "Family"});
+        world.done({"unpublish", "--yes", "--group", "Family"});
         world.done({"sync"});
-        world.done({"unpublish"});
+        world.done({"unpublish", "--yes"});
     }
     std::string contentsOfPeople() {
         std::string all;
@@ -146,7 +146,7 @@ TEST_F(Stopped, SubscribeSaysSoWithinSeconds) {
 }
 
 TEST_F(Stopped, ItIsEndedByWhatHasToRest) {
-    world.done({"unpublish"});
+    world.done({"unpublish", "--yes"});
     EXPECT_NE(world.daemon(), pid);
 }
 

@@ -22,6 +22,7 @@ public:
     std::optional<pid_t> daemon();
     std::unique_ptr<ChildProcess> startRolvane(std::vector<std::string> arguments);
     std::unique_ptr<ChildProcess> startManager(std::vector<std::string> arguments = {});
+    std::vector<std::string> environment() const; // of every program of this person
     std::string databasePath() const { return _home / "data/rolvane/contacts.db"; }
 
     const std::string user;
@@ -29,7 +30,6 @@ public:
 private:
     void makeHome(bool withBus);
     void setAccount(const std::vector<std::string>& account);
-    std::vector<std::string> environment() const;
 
     CommandWorld& _world;
     TempDirectory _home;

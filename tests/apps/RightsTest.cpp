@@ -176,7 +176,7 @@ TEST_F(Rights, WhileTheStoreIsAwayNothingIsChanged) {
 TEST_F(Rights, GoWithThePublication) {
     world.done({"publish"});
     world.done({"share", "bob", "--write"});
-    world.done({"unpublish"});
+    world.done({"unpublish", "--yes", "--forget-shares"});
     world.done({"publish"});
     EXPECT_EQ(world.json({"shares"}), nlohmann::json::array());
     EXPECT_EQ(bob.json({"rights", "alice"})["read"], false);
@@ -234,7 +234,7 @@ TEST_F(RightsOnAFailingStore, AGrantThatWasNeverSavedIsForgottenWithThePublicati
     fails(true);
     EXPECT_EQ(world.rolvane({"share", "bob"}).status, kNotReached);
     fails(false);
-    world.done({"unpublish"});
+    world.done({"unpublish", "--yes", "--forget-shares"});
     world.done({"publish"});
     EXPECT_EQ(world.json({"shares"}), nlohmann::json::array());
 }
@@ -298,7 +298,7 @@ TEST_F(Rights, AChangeOfAGroupThatItsPublisherDeletedIsGivenUpAndTold) {
     bob.done({"subscribe", "alice"});
     bob.done({"daemon", "stop"});
     bob.done({"group", "add", "Circle", "Bea"});
-    world.done({"group", "delete", "Circle"});
+    world.done({"group", "delete", "Circle", "--yes"});
     world.done({"sync"});
     bob.done({"sync"});
     const nlohmann::json status = bob.json({"status"});
@@ -347,7 +347,7 @@ TEST_F(Rights, ChangesOfGroupsThatCameTooLateAreTakenBackInTheCopy) {
     bob.done({"group", "add", "Friends", "Ada"});
     bob.done({"group", "add-group", "Clan", "Friends"});
     bob.done({"delete", "--yes", "Ada"});
-    bob.done({"group", "delete", "Work"});
+    bob.done({"group", "delete", "Work", "--yes"});
     world.done({"share", "bob"});
     bob.rolvane({"sync"});
     EXPECT_GE(bob.json({"status"})["refused"].size(), 1U);

@@ -115,10 +115,10 @@ TEST_F(Sharing, WithdrawingAGroupTakesItsFilesAndThePeopleThatAreOnlyInItOffTheS
     world.done({"publish", "--group", "Work"});
     EXPECT_EQ(world.namedTree(),
               (Names{"AllCXGroup", "Family", "Work", "People/Ada", "People/Bob", "People/Cid", "dateFile", "info"}));
-    world.done({"unpublish", "--group", "Work"});
+    world.done({"unpublish", "--yes", "--group", "Work"});
     EXPECT_EQ(world.namedTree(), (Names{"AllCXGroup", "Family", "People/Ada", "People/Bob", "dateFile", "info"}));
     EXPECT_EQ(world.json({"status"})["published"]["groups"].size(), 1U);
-    world.done({"unpublish", "--group", "Family"});
+    world.done({"unpublish", "--yes", "--group", "Family"});
     EXPECT_EQ(world.namedTree(), Names{});
     EXPECT_TRUE(world.json({"status"})["published"]["groups"].empty());
 }
@@ -128,7 +128,7 @@ TEST_F(Sharing, WithdrawingEverythingTakesTheWholeTreeAway) {
     world.group("Family", {"Ada"});
     world.done({"publish"});
     ASSERT_FALSE(world.tree().empty());
-    world.done({"unpublish"});
+    world.done({"unpublish", "--yes"});
     EXPECT_EQ(world.tree(), std::set<std::string>{});
     EXPECT_EQ(world.json({"list"}).size(), 1U) << "the contacts stay";
     world.done({"publish"});
@@ -138,14 +138,15 @@ TEST_F(Sharing, WithdrawingEverythingTakesTheWholeTreeAway) {
 TEST_F(Sharing, KeepLeavesTheFiles) {
     world.add("Ada");
     world.done({"publish"});
-    world.done({"unpublish", "--keep"});
+    world.done({"unpublish", "--yes", "--keep"});
     EXPECT_TRUE(world.namedTree().contains("People/Ada"));
 }
 
 TEST_F(Sharing, UnpublishOfWhatIsNotPublishedSaysSo) {
     world.add("Ada");
     world.group("Family", {"Ada"});
-    EXPECT_TRUE(saysOnce(world.rolvane({"unpublish", "--group", "Family"}), kNoSuchThing, "not published by itself"));
+    EXPECT_TRUE(
+        saysOnce(world.rolvane({"unpublish", "--yes", "--group", "Family"}), kNoSuchThing, "not published by itself"));
     EXPECT_TRUE(saysOnce(world.rolvane({"publish", "--group", "Nowhere"}), kNoSuchThing, "Nowhere"));
 }
 
@@ -153,9 +154,9 @@ TEST_F(Sharing, AGroupThatIsPublishedByItselfIsNotDeletedUnnoticed) {
     world.add("Ada");
     world.group("Family", {"Ada"});
     world.done({"publish", "--group", "Family"});
-    EXPECT_TRUE(saysOnce(world.rolvane({"group", "delete", "Family"}), kNotAllowed, "unpublish"));
-    world.done({"unpublish", "--group", "Family"});
-    world.done({"group", "delete", "Family"});
+    EXPECT_TRUE(saysOnce(world.rolvane({"group", "delete", "Family", "--yes"}), kNotAllowed, "unpublish"));
+    world.done({"unpublish", "--yes", "--group", "Family"});
+    world.done({"group", "delete", "Family", "--yes"});
 }
 
 TEST_F(Sharing, WhileTheStoreIsAwayChangesWaitAndASyncBringsThem) {

@@ -166,7 +166,7 @@ TEST_F(Subscribing, ACopyThatMayOnlyBeReadIsNotEditedDeletedOrRegrouped) {
     const std::vector<std::vector<std::string>> refused{{"edit", "Bea", "--note", "mine"},
                                                         {"delete", "Bea", "--yes"},
                                                         {"group", "rename", "Family", "Mine"},
-                                                        {"group", "delete", "Family"},
+                                                        {"group", "delete", "Family", "--yes"},
                                                         {"group", "add", "Family", "Own"},
                                                         {"group", "remove", "Family", "Ada Miller"},
                                                         {"add", "--first", "Another", "--group", "Family"}};
@@ -256,7 +256,7 @@ TEST_F(Subscribing, WhatIsWithdrawnLeavesIsKeptAndCanBeTakenBack) {
     EXPECT_TRUE(own[0]["location"].is_null());
     EXPECT_EQ(names(bob.json({"group", "list", "--own"})), std::set<std::string>{"Family"});
     bob.done({"edit", "Bea", "--note", "mine now"});
-    bob.done({"withdrawn", "forget", kept[0]["name"]});
+    bob.done({"withdrawn", "forget", kept[0]["name"], "--yes"});
     EXPECT_EQ(bob.json({"withdrawn", "list"}), nlohmann::json::array());
     EXPECT_FALSE(std::filesystem::exists(kept[0]["file"].get<std::string>()));
     EXPECT_TRUE(saysOnce(bob.rolvane({"withdrawn", "import", "alice"}), kNoSuchThing, "Nothing is kept"));

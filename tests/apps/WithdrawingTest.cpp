@@ -51,9 +51,9 @@ protected:
 
 TEST_F(Withdrawing, IsToldAsADocument) {
     publishTwoGroups();
-    EXPECT_EQ(world.json({"unpublish", "--group", "Work"}),
+    EXPECT_EQ(world.json({"unpublish", "--yes", "--group", "Work"}),
               (nlohmann::json{{"group", "Work"}, {"stillPublished", true}, {"removedFromStore", true}}));
-    EXPECT_EQ(world.json({"unpublish", "--keep"}),
+    EXPECT_EQ(world.json({"unpublish", "--yes", "--keep"}),
               (nlohmann::json{{"group", nullptr}, {"stillPublished", false}, {"removedFromStore", false}}));
     EXPECT_FALSE(world.tree().empty());
 }
@@ -61,8 +61,8 @@ TEST_F(Withdrawing, IsToldAsADocument) {
 TEST_F(Withdrawing, ThatFailsInTheMiddleIsFinishedByTheNextPublication) {
     world.done({"publish"});
     storeFailsAt("tree");
-    EXPECT_TRUE(
-        saysOnce(world.rolvane({"unpublish"}), kFailure, "could not be removed from the store (it answered 500)"));
+    EXPECT_TRUE(saysOnce(world.rolvane({"unpublish", "--yes"}), kFailure,
+                         "could not be removed from the store (it answered 500)"));
     EXPECT_TRUE(anythingLeft());
     EXPECT_NE(world.done({"status"}).find("still on the store"), std::string::npos);
     for (const std::string& path : world.tree()) // it had come some way
@@ -81,12 +81,12 @@ TEST_F(Withdrawing, ThatFailsInTheMiddleIsFinishedByTheNextPublication) {
 TEST_F(Withdrawing, ThatFailsIsFinishedWhenItIsRepeated) {
     world.done({"publish"});
     storeFailsAt("tree");
-    EXPECT_EQ(world.rolvane({"unpublish"}).status, kFailure);
+    EXPECT_EQ(world.rolvane({"unpublish", "--yes"}).status, kFailure);
     world.store().stop(PrivateStore::Stop::atOnce);
-    EXPECT_TRUE(saysOnce(world.rolvane({"unpublish"}), kNotReached, "it did not answer"));
+    EXPECT_TRUE(saysOnce(world.rolvane({"unpublish", "--yes"}), kNotReached, "it did not answer"));
     world.store().start();
     storeWorksAgain();
-    world.done({"unpublish"});
+    world.done({"unpublish", "--yes"});
     EXPECT_EQ(world.tree(), Names{});
     EXPECT_FALSE(anythingLeft());
 }
@@ -94,21 +94,22 @@ TEST_F(Withdrawing, ThatFailsIsFinishedWhenItIsRepeated) {
 TEST_F(Withdrawing, OfAGroupThatFailsInTheMiddleIsFinishedWhenItIsRepeated) {
     publishTwoGroups();
     storeFailsAt("people");
-    EXPECT_TRUE(saysOnce(world.rolvane({"unpublish", "--group", "Work"}), kFailure, "a contact of the group"));
+    EXPECT_TRUE(saysOnce(world.rolvane({"unpublish", "--yes", "--group", "Work"}), kFailure, "a contact of the group"));
     EXPECT_TRUE(world.namedTree().contains("People/Cid"));
     EXPECT_TRUE(world.daemon()) << "it serves what is still published";
     storeWorksAgain();
-    world.done({"unpublish", "--group", "Work"});
+    world.done({"unpublish", "--yes", "--group", "Work"});
     EXPECT_EQ(world.namedTree(), family);
     EXPECT_FALSE(anythingLeft());
-    EXPECT_TRUE(saysOnce(world.rolvane({"unpublish", "--group", "Work"}), kNoSuchThing, "not published by itself"));
+    EXPECT_TRUE(
+        saysOnce(world.rolvane({"unpublish", "--yes", "--group", "Work"}), kNoSuchThing, "not published by itself"));
     EXPECT_TRUE(world.daemon());
 }
 
 TEST_F(Withdrawing, OfAGroupThatFailsInTheMiddleIsFinishedByTheNextPublication) {
     publishTwoGroups();
     storeFailsAt("people");
-    EXPECT_EQ(world.rolvane({"unpublish", "--group", "Work"}).status, kFailure);
+    EXPECT_EQ(world.rolvane({"unpublish", "--yes", "--group", "Work"}).status, kFailure);
     storeWorksAgain();
     world.done({"delete", "--yes", "Cid"});
     world.done({"publish", "--group", "Work"});
@@ -120,11 +121,11 @@ TEST_F(Withdrawing, OfAGroupThatFailsInTheMiddleIsFinishedByTheNextPublication) 
 TEST_F(Withdrawing, LeavesWhoHasComeIntoAnotherPublishedGroupBeforeItWasFinished) {
     publishTwoGroups();
     storeFailsAt("people");
-    EXPECT_EQ(world.rolvane({"unpublish", "--group", "Work"}).status, kFailure);
+    EXPECT_EQ(world.rolvane({"unpublish", "--yes", "--group", "Work"}).status, kFailure);
     storeWorksAgain();
     world.done({"group", "add", "Family", "Cid"});
     world.done({"sync"});
-    world.done({"unpublish", "--group", "Work"});
+    world.done({"unpublish", "--yes", "--group", "Work"});
     Names withCid = family;
     withCid.insert("People/Cid");
     EXPECT_EQ(world.namedTree(), withCid);
@@ -134,25 +135,25 @@ TEST_F(Withdrawing, OfTheLastGroupThatFailsIsFinishedByTheSameCommand) {
     world.group("Family", {"Ada", "Bob"});
     world.done({"publish", "--group", "Family"});
     storeFailsAt("tree");
-    EXPECT_EQ(world.rolvane({"unpublish", "--group", "Family"}).status, kFailure);
+    EXPECT_EQ(world.rolvane({"unpublish", "--yes", "--group", "Family"}).status, kFailure);
     storeWorksAgain();
-    world.done({"unpublish", "--group", "Family"});
+    world.done({"unpublish", "--yes", "--group", "Family"});
     EXPECT_EQ(world.tree(), Names{});
 }
 
 TEST_F(Withdrawing, ThatFailedAndIsRepeatedWithKeepLeavesTheFiles) {
     world.done({"publish"});
     storeFailsAt("tree");
-    EXPECT_EQ(world.rolvane({"unpublish"}).status, kFailure);
+    EXPECT_EQ(world.rolvane({"unpublish", "--yes"}).status, kFailure);
     storeWorksAgain();
-    world.done({"unpublish", "--keep"});
+    world.done({"unpublish", "--yes", "--keep"});
     EXPECT_TRUE(world.namedTree().contains("People/Ada"));
     EXPECT_FALSE(anythingLeft());
 }
 
 TEST_F(Withdrawing, ThatWasKilledBeforeItTookAnythingAwayIsFinished) {
     world.done({"publish"});
-    world.done({"unpublish", "--keep"});
+    world.done({"unpublish", "--yes", "--keep"});
     noteTheTree();
     EXPECT_TRUE(anythingLeft());
     world.done({"delete", "--yes", "Ada"});
@@ -169,7 +170,7 @@ TEST_F(Withdrawing, ThatWasKilledBeforeItWasSavedTakesNothingOffTheStore) {
     world.done({"publish"});
     EXPECT_EQ(contentsOf(world.published("info")), before) << "it is the same tree";
     EXPECT_TRUE(world.namedTree().contains("People/Ada"));
-    world.done({"unpublish"});
+    world.done({"unpublish", "--yes"});
     EXPECT_EQ(world.tree(), Names{});
     EXPECT_FALSE(anythingLeft());
 }

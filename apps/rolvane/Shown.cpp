@@ -1,0 +1,44 @@
+#include "Shown.h"
+
+#include "Counted.h"
+#include "Publication.h"
+
+#include "contacts/records/Identifier.h"
+
+namespace rolvane::cli {
+
+std::string Shown::amount() const {
+    const std::string text = counted(people.size(), "person", "people");
+    return groups.empty() ? text : text + " and " + counted(groups.size(), "group", "groups");
+}
+
+Shown shownToReaders(CXRolvane& database) {
+    const Publication publication(database);
+    Shown shown;
+    if (!publication.everything()) {
+        shown.groups = publication.groups();
+        for (const CXGroupRef& group : shown.groups)
+            for (const UniqueId& member : group->memberUniqueIds())
+                if (const auto row = database.personRow(member); row && row->location.empty())
+                    shown.people.insert(member);
+        return shown;
+    }
+    for (const UniqueId& person : database.peopleOfTable(kCXPersonTable)) shown.people.insert(person);
+    for (const CXListing& listing : database.listGroups(RemoteLocation("")))
+        if (auto group = std::dynamic_pointer_cast<CXGroup>(database.recordForUniqueId(listing.uniqueId)))
+            shown.groups.push_back(std::move(group));
+    return shown;
+}
+
+Shown without(const Shown& all, const Shown& those) {
+    Shown rest;
+    for (const UniqueId& person : all.people)
+        if (!those.people.contains(person)) rest.people.insert(person);
+    std::set<UniqueId> groups;
+    for (const CXGroupRef& group : those.groups) groups.insert(group->uniqueId());
+    for (const CXGroupRef& group : all.groups)
+        if (!groups.contains(group->uniqueId())) rest.groups.push_back(group);
+    return rest;
+}
+
+} // namespace rolvane::cli
