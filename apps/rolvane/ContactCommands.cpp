@@ -4,6 +4,7 @@
 #include "ImportReport.h"
 #include "Lookup.h"
 #include "PersonFields.h"
+#include "Publication.h"
 #include "RecordJson.h"
 #include "SafeText.h"
 #include "Shares.h"
@@ -72,6 +73,10 @@ void importCards(Context& context, const ImportOptions& options) {
         report = import.finish();
     }
     reportImport(context, report, unreadable, options.dryRun);
+    const std::vector<std::string> readers = Shares(context.database()).readers();
+    if (options.dryRun && report.imported > 0 && !readers.empty() && Publication(context.database()).everything())
+        context.say(fmt::format("All your contacts are published: {} would become readable for {}.",
+                                counted(report.imported, "person", "people"), usersText(readers)));
 }
 
 // export ---------------------------------------------------------------------------------------------------------

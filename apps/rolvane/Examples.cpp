@@ -51,6 +51,9 @@ const std::map<std::string, const char*>& examples() {
                         "      --password-command 'pass show dav.example.org'\n"
                         "  rolvane account set --password-file ~/.config/rolvane/password"},
         {"account test", "  rolvane account test && rolvane publish"},
+        {"plan", "  rolvane plan\n"
+                 "  rolvane publish --dry-run\n"
+                 "  rolvane import friends.vcf --dry-run"},
         {"publish", "  rolvane publish\n"
                     "  rolvane publish --group Family"},
         {"unpublish", "  rolvane unpublish --group Family\n"

@@ -4,6 +4,7 @@
 #include "Passes.h"
 #include "Publication.h"
 #include "Shares.h"
+#include "Shown.h"
 #include "Subscriptions.h"
 #include "ValueNames.h"
 
@@ -26,7 +27,7 @@ constexpr const char* kAllACLChanged = "CXAllACLChanged";
 
 struct ShareOptions {
     std::string user;
-    bool write = false, noWait = false, noDaemon = false;
+    bool write = false, dryRun = false, noWait = false, noDaemon = false;
     double timeout = kPassSeconds;
 };
 
@@ -148,6 +149,26 @@ std::optional<PassOutcome> carry(Context& context, PassWatch& watch, const Share
                                             options.user));
 }
 
+void tellSharing(Context& context, const ShareOptions& options, const std::string& user) {
+    CXRolvane& database = context.database();
+    const Shares shares(database);
+    const Shown shown = shownToReaders(database);
+    const bool same = shares.mayRead(user) && shares.mayWrite(user) == options.write;
+    if (context.json) {
+        Json data = trialJson(shares.mayRead(user) ? Shown() : shown, {user});
+        data["rights"] = options.write ? "write" : "read";
+        data["rightsNow"] = orNull(rightsHere(shares, user));
+        context.print(data);
+    }
+    context.say(same ? fmt::format("\"{}\" may do so already.", user)
+                     : fmt::format("{} {} \"{}\"{}. Nothing was changed: this was a trial.", shown.amount(),
+                                   shares.mayRead(user) ? (options.write ? "would become changeable for"
+                                                                         : "would no longer be changeable for")
+                                   : options.write      ? "would become readable and changeable for"
+                                                        : "would become readable for",
+                                   user, shares.mayRead(user) && !options.write ? ", who may go on reading" : ""));
+}
+
 void changeShares(Context& context, const ShareOptions& options, bool grant) {
     const Url base = ownBase();
     const std::string user = checkedUser(options.user);
@@ -170,6 +191,7 @@ void changeShares(Context& context, const ShareOptions& options, bool grant) {
         if (context.json) context.print({{"user", user}, {"rights", nullptr}, {"pass", nullptr}});
         return;
     }
+    if (options.dryRun) return tellSharing(context, options, user);
     requireAccessLists(base, user);
 
     const std::vector<std::string> writers = shares.writers();
@@ -304,6 +326,7 @@ void addShareCommands(CLI::App& app, Context& context) {
         [&](CLI::App& command) {
             common(command, kUserValue);
             command.add_flag("--write", o->write, "Changes are allowed; without it reading only");
+            declareTrial(command, o->dryRun);
         },
         [&context, o] { changeShares(context, *o, true); });
     addCommand(

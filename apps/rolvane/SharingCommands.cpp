@@ -1,6 +1,5 @@
 #include "Consent.h"
 #include "Context.h"
-#include "Counted.h"
 #include "FailureText.h"
 #include "LeftOnStore.h"
 #include "Lookup.h"
@@ -23,7 +22,7 @@ namespace {
 
 struct PublishOptions {
     std::string group;
-    bool noWait = false, noDaemon = false, keep = false, forgetShares = false, yes = false;
+    bool noWait = false, noDaemon = false, keep = false, forgetShares = false, yes = false, dryRun = false;
     double timeout = kPassSeconds;
 };
 
@@ -57,37 +56,70 @@ void removeWhatIsLeft(CXRolvane& database, const Url& base) {
     });
 }
 
-// "bob", "bob and cid", "bob, cid and 2 others".
-std::string namedUsers(const std::vector<std::string>& users) {
-    constexpr size_t kMost = 3;
-    const size_t named = users.size() <= kMost ? users.size() : kMost - 1;
-    std::string text;
-    for (size_t i = 0; i < named; i++) text += (i == 0 ? "" : i + 1 == users.size() ? " and " : ", ") + users[i];
-    return named == users.size() ? text : fmt::format("{} and {} others", text, users.size() - named);
+void withdrawAll(Publication& publication) {
+    publication.withdrawEverything();
+    for (const CXGroupRef& single : publication.groups()) publication.withdrawGroup(single);
 }
 
-// People that somebody gets to see who has not seen them before, of whom there is a question first.
-void askAboutReaders(Context& context, const PublishOptions& options, const CXGroupRef& group, const Url& base) {
-    CXRolvane& database = context.database();
-    const std::vector<std::string> readers = Shares(database).readers();
-    if (readers.empty()) return;
+// What everybody who reads would see that nobody has seen before. The database stays as it is.
+Shown newlyShown(CXRolvane& database, const CXGroupRef& group, const Url& base) {
     Publication publication(database);
     const Shown before = shownToReaders(database);
     group ? publication.publishGroup(group, base) : publication.publishEverything(base);
     const Shown more = without(shownToReaders(database), before);
     database.rollback();
+    return more;
+}
+
+// And what would be seen no longer.
+Shown nextHidden(CXRolvane& database, const CXGroupRef& group) {
+    Publication publication(database);
+    const Shown before = shownToReaders(database);
+    group ? (void)publication.withdrawGroup(group) : withdrawAll(publication);
+    const Shown less = without(before, shownToReaders(database));
+    database.rollback();
+    return less;
+}
+
+std::string namedWhole(const CXGroupRef& group) {
+    return group ? fmt::format("the group \"{}\"", group->name()) : "all contacts";
+}
+
+void tellTrial(Context& context, const Shown& what, const std::vector<std::string>& users,
+               const std::string& sentence) {
+    if (context.json) context.print(trialJson(what, users));
+    context.say(sentence + " Nothing was changed: this was a trial.");
+}
+
+void tellPublishing(Context& context, const CXGroupRef& group, const Url& base) {
+    CXRolvane& database = context.database();
+    const Shown more = newlyShown(database, group, base);
+    const std::vector<std::string> readers = Shares(database).readers();
+    const std::string what =
+        more.empty() && (Publication(database).everything() || (group && Publication(database).publishes(group)))
+            ? fmt::format("Of {} everything is published already", namedWhole(group))
+            : fmt::format("{} would go to {}", more.amount(), base.absoluteString());
+    tellTrial(context, more, readers,
+              readers.empty() ? what + ". You share with nobody yet."
+                              : fmt::format("{}, readable for {}.", what, usersText(readers)));
+}
+
+void askAboutReaders(Context& context, const PublishOptions& options, const CXGroupRef& group, const Url& base) {
+    const std::vector<std::string> readers = Shares(context.database()).readers();
+    if (readers.empty()) return;
+    const Shown more = newlyShown(context.database(), group, base);
     if (more.empty()) return;
     requireConsent(context, options.yes,
-                   fmt::format("Publish {}? {} {} readable for {} ({}).",
-                               group ? fmt::format("the group \"{}\"", group->name()) : "all contacts", more.amount(),
-                               more.isOne() ? "becomes" : "become", counted(readers.size(), "user", "users"),
-                               namedUsers(readers)),
+                   fmt::format("Publish {}? {} {} readable for {}.", namedWhole(group), more.amount(),
+                               more.isOne() ? "becomes" : "become", usersText(readers)),
                    "Nothing was published.");
 }
 
 void publish(Context& context, const PublishOptions& options) {
     const Url base = ownBase();
     CXRolvane& database = context.database();
+    const CXGroupRef group = options.group.empty() ? nullptr : findGroup(database, options.group);
+    if (options.dryRun) return tellPublishing(context, group, base);
     Publication publication(database);
     const bool served = publication.anything();
 
@@ -98,7 +130,6 @@ void publish(Context& context, const PublishOptions& options) {
     } else if (!served) {
         requireUsableStore("Nothing was published.");
     }
-    const CXGroupRef group = options.group.empty() ? nullptr : findGroup(database, options.group);
     askAboutReaders(context, options, group, base);
     removeWhatIsLeft(database, base);
 
@@ -123,11 +154,6 @@ void publish(Context& context, const PublishOptions& options) {
     if (mayGoBetter(outcome)) outcome = makePass(context, options.timeout);
     report(context, outcome, "Everything is on the store.", true);
     if (context.json) context.print(outcomeJson(outcome));
-}
-
-void withdrawAll(Publication& publication) {
-    publication.withdrawEverything();
-    for (const CXGroupRef& single : publication.groups()) publication.withdrawGroup(single);
 }
 
 // What is withdrawn, as the beginning of a sentence.
@@ -178,28 +204,35 @@ void unpublishAtRest(Context& context, const PublishOptions& options, const CXGr
                                        : "."));
 }
 
+void tellWithdrawal(Context& context, const PublishOptions& options, const CXGroupRef& group) {
+    CXRolvane& database = context.database();
+    if (group && !Publication(database).publishes(group))
+        throw CommandError(kNotFound, fmt::format("The group \"{}\" is not published by itself.", group->name()));
+    const Shown gone = nextHidden(database, group);
+    const std::vector<std::string> readers = Shares(database).readers();
+    const char* where = options.keep ? "would no longer be kept in step on the store" : "would leave the store";
+    tellTrial(context, gone, readers,
+              !Publication(database).anything() ? "Nothing is published."
+              : gone.empty()    ? "Nothing would leave the store: the group stays there as part of the contact list."
+              : readers.empty() ? fmt::format("{} {}. You share with nobody.", gone.amount(), where)
+                                : fmt::format("{} {}, where {} could read {}.", gone.amount(), where,
+                                              usersText(readers), gone.isOne() ? "it" : "them"));
+}
+
 // Asks before anything leaves the store, and anybody's database with it.
 void askAboutWithdrawal(Context& context, const PublishOptions& options, const CXGroupRef& group) {
     CXRolvane& database = context.database();
-    Publication publication(database);
-    const Shown before = shownToReaders(database);
-    if (before.groups.empty() && !publication.everything()) return; // nothing is published
-    if (group && !publication.publishes(group)) return;
-    if (group)
-        publication.withdrawGroup(group);
-    else
-        withdrawAll(publication);
-    const Shown gone = without(before, shownToReaders(database));
-    database.rollback();
+    if (group ? !Publication(database).publishes(group) : !Publication(database).anything()) return;
+    const Shown gone = nextHidden(database, group);
     if (group && gone.empty()) return; // it stays as a part of the contact list
     const std::vector<std::string> readers = Shares(database).readers();
     const char* verb = options.keep ? (readers.size() == 1 ? "gets no more news of" : "get no more news of")
                                     : (readers.size() == 1 ? "loses" : "lose");
     requireConsent(context, options.yes,
                    fmt::format("{} {}? {}{}.", options.keep ? "Stop publishing" : "Take off the store", gone.amount(),
-                               readers.empty() ? "You share with nobody"
-                                               : fmt::format("{} ({}) {} {}", counted(readers.size(), "user", "users"),
-                                                             namedUsers(readers), verb, gone.isOne() ? "it" : "them"),
+                               readers.empty()
+                                   ? "You share with nobody"
+                                   : fmt::format("{} {} {}", usersText(readers), verb, gone.isOne() ? "it" : "them"),
                                options.keep ? "; the files stay there" : ""),
                    "Everything is still published.");
 }
@@ -207,6 +240,7 @@ void askAboutWithdrawal(Context& context, const PublishOptions& options, const C
 void unpublish(Context& context, const PublishOptions& options) {
     ownBase(); // there is an account
     const CXGroupRef group = options.group.empty() ? nullptr : findGroup(context.database(), options.group);
+    if (options.dryRun) return tellWithdrawal(context, options, group);
     askAboutWithdrawal(context, options, group);
     whileDaemonRests([&] { unpublishAtRest(context, options, group); }); // nothing is written behind our back
 }
@@ -221,6 +255,7 @@ void addSharingCommands(CLI::App& app, Context& context) {
             command.add_option("-g,--group", options->group, "Publish this group only (name or identifier)")
                 ->type_name(kGroupValue);
             declareConsent(command, options->yes);
+            declareTrial(command, options->dryRun);
             command.add_flag("--no-wait", options->noWait, "Return as soon as the daemon is at work");
             command.add_flag("--no-daemon", options->noDaemon, "Only note it; do not start the daemon");
             command.add_option("--timeout", options->timeout, "Seconds to wait for the pass")
@@ -238,6 +273,7 @@ void addSharingCommands(CLI::App& app, Context& context) {
                              "Forget with whom you share, too, when nothing stays published; without it, the next "
                              "publication is shared with the same users");
             declareConsent(command, options->yes);
+            declareTrial(command, options->dryRun);
         },
         [&context, options] { unpublish(context, *options); });
     const auto seconds = std::make_shared<double>(kPassSeconds);

@@ -2,6 +2,7 @@
 
 #include "Counted.h"
 #include "Publication.h"
+#include "SafeText.h"
 
 #include "contacts/records/Identifier.h"
 
@@ -28,6 +29,24 @@ Shown shownToReaders(CXRolvane& database) {
         if (auto group = std::dynamic_pointer_cast<CXGroup>(database.recordForUniqueId(listing.uniqueId)))
             shown.groups.push_back(std::move(group));
     return shown;
+}
+
+std::string usersText(const std::vector<std::string>& users) {
+    constexpr size_t kMost = 3;
+    const size_t named = users.size() <= kMost ? users.size() : kMost - 1;
+    std::string names;
+    for (size_t i = 0; i < named; i++)
+        names += (i == 0 ? "" : i + 1 == users.size() ? " and " : ", ") + shownLine(users[i]);
+    if (named < users.size()) names += fmt::format(" and {} others", users.size() - named);
+    return counted(users.size(), "user", "users") + (users.empty() ? "" : " (" + names + ")");
+}
+
+void declareTrial(CLI::App& command, bool& dryRun) {
+    command.add_flag("--dry-run", dryRun, "Tell what would happen, and change nothing");
+}
+
+nlohmann::ordered_json trialJson(const Shown& what, const std::vector<std::string>& users) {
+    return {{"dryRun", true}, {"people", what.people.size()}, {"groups", what.groups.size()}, {"users", users}};
 }
 
 Shown without(const Shown& all, const Shown& those) {

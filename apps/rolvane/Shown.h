@@ -2,6 +2,8 @@
 
 #include "contacts/database/CXRolvane.h"
 
+#include <CLI/CLI.hpp>
+#include <nlohmann/json.hpp>
 #include <set>
 #include <string>
 #include <vector>
@@ -18,6 +20,13 @@ struct Shown {
     bool isOne() const { return people.size() + groups.size() == 1; }
 };
 Shown shownToReaders(CXRolvane& database);
+// "1 user (bob)", "2 users (bob and cid)", "5 users (bob, cid and 3 others)".
+std::string usersText(const std::vector<std::string>& users);
+
+// --dry-run: a command tells what it would do, and changes nothing: no byte here or on the store.
+void declareTrial(CLI::App& command, bool& dryRun);
+nlohmann::ordered_json trialJson(const Shown& what, const std::vector<std::string>& users);
+
 // What is in the one and not in the other.
 Shown without(const Shown& all, const Shown& those);
 

@@ -5,6 +5,7 @@
 #include "PassReport.h"
 #include "Passes.h"
 #include "Publication.h"
+#include "Shown.h"
 #include "Subscribe.h"
 #include "Subscriptions.h"
 #include "ValueNames.h"
@@ -31,7 +32,7 @@ constexpr int kMissing = 404;
 
 struct SubscribeOptions {
     std::string named;
-    bool noWait = false, noDaemon = false;
+    bool noWait = false, noDaemon = false, dryRun = false;
     double timeout = kPassSeconds;
 };
 
@@ -121,6 +122,23 @@ void waitForPeople(Context& context, PassWatch& watch, OutcomeWatch& outcomes, c
         context.exitCode = kFailed;
 }
 
+// How much lies there, by the list of everybody; nothing is fetched but that one.
+void tellSubscribing(Context& context, const RemoteLocation& location) {
+    const auto all = CXDAVManager::defaultManager().dictionaryAtURL(
+        layout::groupLocation(Url(location.str()), UniqueId(layout::kAllGroup)), false, nullptr);
+    const std::string user = publisherOf(location);
+    if (!all)
+        throw CommandError(
+            kUnreachable,
+            fmt::format("The list of what \"{}\" has published could not be read. Try again later.", user));
+    const size_t people = (*all)["memberUIDState"].array().count(), groups = (*all)["subgroupUIDState"].array().count();
+    if (context.json)
+        context.print(Json{
+            {"dryRun", true}, {"user", user}, {"location", location.str()}, {"people", people}, {"groups", groups}});
+    context.say(fmt::format("{} and {} of \"{}\" would come. Nothing was changed: this was a trial.",
+                            counted(people, "person", "people"), counted(groups, "group", "groups"), user));
+}
+
 void subscribe(Context& context, const SubscribeOptions& options) {
     (void)ownBase();
     const RemoteLocation location = namedLocation(options.named);
@@ -135,6 +153,7 @@ void subscribe(Context& context, const SubscribeOptions& options) {
                                                  "new, `rolvane subscriptions` tells how it stands.",
                                                  user));
     requirePublication(location);
+    if (options.dryRun) return tellSubscribing(context, location);
 
     const bool served = Publication(database).anything() || !subscriptionsToPeople(database).empty();
     PassWatch watch(context, !context.quiet);
@@ -222,6 +241,7 @@ void addSubscriptionCommands(CLI::App& app, Context& context) {
             command.add_option("user", options->named, "User name on the store, or a location")
                 ->required()
                 ->type_name(kUserValue);
+            declareTrial(command, options->dryRun);
             command.add_flag("--no-wait", options->noWait, "Return as soon as the daemon is at work");
             command.add_flag("--no-daemon", options->noDaemon, "Only note it; do not start the daemon");
             command.add_option("--timeout", options->timeout, "Seconds to wait for the pass")

@@ -3,6 +3,7 @@
 #include "Context.h"
 #include "HelpCommand.h"
 #include "ManualCommand.h"
+#include "PlanCommand.h"
 #include "SafeText.h"
 #include "SeeingCommands.h"
 #include "SetupCommands.h"
@@ -103,6 +104,7 @@ int main(int argc, char** argv) {
     addBooksCommands(app, context);
     addDatabaseCommands(app, context);
     addSeeingCommands(app, context);
+    addPlanCommand(app, context);
     addHelpCommand(app, context);
 
     try {

@@ -71,7 +71,7 @@ TEST_F(DebianStore, CarriesEverythingFromThePublicationToItsEnd) {
     expectDone(alice->rolvane({"edit", "Ada", "--nickname", "Lady"}));
     expectDone(alice->rolvane({"sync"}));
     EXPECT_NE(nickname(*bob, "Ada"), "Lady") << "the right is gone";
-    expectDone(alice->rolvane({"unpublish"}));
+    expectDone(alice->rolvane({"unpublish", "--yes"}));
     EXPECT_TRUE(comesTrue([&] { return !std::filesystem::exists(tree() + "/dateFile"); }));
 }
 

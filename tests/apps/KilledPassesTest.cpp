@@ -165,7 +165,7 @@ TEST_F(KilledPublisher, LeavesNothingOnTheStoreOfWhatIsTakenBackBeforeTheNextPas
 class KilledFirstPublication : public KilledPublisher {
 protected:
     KilledFirstPublication() : KilledPublisher(300) {
-        world.done({"unpublish", "--yes"});
+        world.done({"unpublish", "--yes", "--forget-shares"});
         world.rolvane({"daemon", "stop"});
         for (const char* key : {"CXDShareCount", "CXDLastOstrelUser"}) world.done({"defaults", "delete", key});
         world.done({"publish", "--no-daemon"});
@@ -201,7 +201,7 @@ TEST_F(KilledFirstPublication, CanBeWithdrawnAtOnce) {
     };
     ASSERT_TRUE(waitUntil(knowsItsLock, "a lock of the pass")) << daemon->errors();
     daemon->kill();
-    world.done({"unpublish", "--yes"});
+    world.done({"unpublish", "--yes", "--forget-shares"});
     EXPECT_TRUE(world.tree().empty());
 }
 

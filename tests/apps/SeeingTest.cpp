@@ -35,7 +35,7 @@ TEST_F(Seeing, AReaderOfAGroupSeesItsMembersAndOfEverythingEverybody) {
     ASSERT_EQ(seen["people"].size(), 1U);
     EXPECT_EQ(seen["people"][0]["name"], "Ada");
     EXPECT_EQ(seen["groups"][0]["members"], 1);
-    world.done({"publish", "--no-daemon"});
+    world.done({"publish", "--no-daemon", "--yes"});
     world.done({"share", "bob", "--write", "--no-daemon"});
     EXPECT_EQ(world.done({"who", "Cleo"}), "bob  read and write, through all your contacts\n");
     seen = world.json({"preview", "bob"});
@@ -64,7 +64,7 @@ TEST_F(Seeing, ThePreviewIsWhatIsPublished) {
     world.done({"publish", "--group", "Family"});
     world.done({"share", "bob"});
     EXPECT_EQ(previewed(), peopleOf());
-    world.done({"publish"});
+    world.done({"publish", "--yes"});
     EXPECT_EQ(previewed(), peopleOf());
     EXPECT_EQ(previewed().size(), 3U);
 }

@@ -219,7 +219,7 @@ TEST_F(Subscribing, ChangesThatWereNotSentAreDroppedWithTheSubscriptionAndToldSo
     bob.done({"edit", "Bea", "--note", "never sent"});
     EXPECT_EQ(bob.rolvane({"sync"}).status, kNotReached);
     ASSERT_GT(bob.json({"subscriptions"})[0]["pending"].get<int>(), 0);
-    const Ran ended = bob.rolvane({"unsubscribe", "alice"});
+    const Ran ended = bob.rolvane({"unsubscribe", "alice", "--yes"});
     EXPECT_EQ(ended.status, kDone) << ended;
     EXPECT_NE(ended.errors.find("had not been sent yet"), std::string::npos) << ended;
     EXPECT_EQ(bob.json({"status"})["pending"], 0);
