@@ -3,9 +3,8 @@
 #include "contacts/vcard/VCardText.h"
 #include "server/mod_cardbook/Refused.h"
 #include "server/mod_cardbook/XmlText.h"
+#include "server/mod_davacl/SyncRequest.h"
 #include "server/mod_davacl/XmlElements.h"
-
-#include <charconv>
 
 namespace rolvane::cardbook {
 namespace {
@@ -45,12 +44,8 @@ void readProperties(const apr_xml_doc* doc, const apr_xml_elem* prop, ReportRequ
 }
 
 std::optional<uint64_t> limitOf(const apr_xml_elem* number) {
-    if (!number) return std::nullopt;
-    const std::string text = textOf(number);
-    uint64_t value = 0;
-    const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), value);
-    if (error != std::errc() || end != text.data() + text.size() || value == 0)
-        badRequest("nresults is no number above 0.");
+    std::optional<uint64_t> value;
+    if (!davacl::readNumberOfResults(number, value)) badRequest("nresults is no number above 0.");
     return value;
 }
 
@@ -77,12 +72,12 @@ ReportRequest parseReport(const apr_xml_doc* doc) {
         request.limit = limitOf(cardChild(doc, cardChild(doc, root, "limit"), "nresults"));
         break;
     default: {
-        const apr_xml_elem* token = child(root, "sync-token");
-        if (!token) badRequest("A sync-collection has a DAV:sync-token, which may be empty.");
-        if (textOf(child(root, "sync-level")) == "infinite")
-            throw Refused(403, kDavSpace, "sync-traversal-supported", "There is nothing below a book.");
-        request.token = textOf(token);
-        request.limit = limitOf(child(child(root, "limit"), "nresults"));
+        const char* problem = nullptr;
+        const auto sync = davacl::parseSyncRequest(root, problem);
+        if (!sync) badRequest(problem);
+        if (sync->isDeep) throw Refused(403, kDavSpace, "sync-traversal-supported", "There is nothing below a book.");
+        request.token = sync->token;
+        request.limit = sync->limit;
     }
     }
     return request;

@@ -198,6 +198,12 @@ void OwnersLists::move(const std::string& from, const std::string& to) {
     _lists.merge(moved);
 }
 
+std::vector<std::string> OwnersLists::trees() const {
+    std::vector<std::string> found;
+    for (const auto& [tree, list] : _lists) found.push_back(tree);
+    return found;
+}
+
 bool OwnersLists::mentionsGroups() const {
     for (const auto& [tree, list] : _lists)
         for (const Grant& grant : list)

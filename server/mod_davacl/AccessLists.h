@@ -56,6 +56,7 @@ public:
     void move(const std::string& from, const std::string& to);
     bool has(const std::string& tree) const; // the tree or anything below has one
     bool empty() const { return _lists.empty(); }
+    std::vector<std::string> trees() const; // that have a list
     bool mentionsGroups() const;
 
     // The privileges that each list grants to the caller and denies, by the list's tree. Every entry is looked at once,

@@ -5,6 +5,7 @@
 #include "server/mod_davacl/News.h"
 #include "server/mod_davacl/PrincipalResources.h"
 #include "server/mod_davacl/Reports.h"
+#include "server/mod_davacl/SyncCollection.h"
 #include "server/mod_davacl/WaitingRequests.h"
 
 #include <string_view>
@@ -22,6 +23,7 @@ enum Property {
     kPrincipalCollectionSet,
     kCurrentUserPrincipal,
     kSupportedReportSet,
+    kSyncToken,
     kMembersTag
 };
 const char* const kNamespaces[] = {"DAV:", kOwnNamespace, nullptr};
@@ -35,6 +37,7 @@ const dav_liveprop_spec kProperties[] = {{0, "owner", kOwner, 0},
                                          {0, "principal-collection-set", kPrincipalCollectionSet, 0},
                                          {0, "current-user-principal", kCurrentUserPrincipal, 0},
                                          {0, "supported-report-set", kSupportedReportSet, 0},
+                                         {0, "sync-token", kSyncToken, 0},
                                          {kOwn, kMembersTagName, kMembersTag, 0},
                                          {0, nullptr, 0, 0}};
 
@@ -107,15 +110,6 @@ std::string_view withoutSlash(std::string_view path) {
     return path.substr(0, path.find_last_not_of('/') + 1);
 }
 
-// The directory that a collection is, below or at the one that the request names.
-std::optional<std::string> directoryOf(request_rec* r, const dav_resource* resource) {
-    const std::string_view asked = withoutSlash(r->uri), path = withoutSlash(resource->uri);
-    if (!r->filename || !servesFiles(r) || !path.starts_with(asked)) return std::nullopt;
-    const std::string_view below = path.substr(asked.size());
-    if (!below.empty() && below.front() != '/') return std::nullopt;
-    return std::string(withoutSlash(r->filename)) + std::string(below);
-}
-
 std::optional<std::string> tagOf(const Asked& a, const dav_resource* resource) {
     if (!resource->collection || !resource->exists || !(privilegesOn(a.r, a.c, a.place) & kRead)) return std::nullopt;
     const auto directory = directoryOf(a.r, resource);
@@ -125,7 +119,7 @@ std::optional<std::string> tagOf(const Asked& a, const dav_resource* resource) {
 }
 
 // Nothing: not defined there, or not for this user.
-std::optional<std::string> valueOf(const Asked& a, int property) {
+std::optional<std::string> valueOf(const Asked& a, int property, const dav_resource* resource) {
     const unsigned mine = privilegesOn(a.r, a.c, a.place);
     switch (property) {
     case kOwner:
@@ -143,7 +137,9 @@ std::optional<std::string> valueOf(const Asked& a, int property) {
         return text;
     }
     case kPrincipalCollectionSet: return principalCollections(a.r, a.c);
-    case kSupportedReportSet: return supportedReports(true) + (tellsNews(a.r) ? newsReportElement() : std::string());
+    case kSupportedReportSet:
+        return supportedReports(true, canSynchronize(a.r, resource)) +
+               (tellsNews(a.r) ? newsReportElement() : std::string());
     case kCurrentUserPrincipal: return currentUserPrincipal(a.r, a.c);
     default: return std::nullopt;
     }
@@ -175,7 +171,9 @@ dav_prop_insert insertProperty(const dav_resource* resource, int property, dav_p
                 apr_text_append(resource->pool, text, "</D:acl>\n");
                 return what;
             }
-            const auto value = property == kMembersTag ? tagOf(asked, resource) : valueOf(asked, property);
+            const auto value = property == kMembersTag  ? tagOf(asked, resource)
+                               : property == kSyncToken ? syncTokenOf(r, resource)
+                                                        : valueOf(asked, property, resource);
             if (!value) return DAV_PROP_INSERT_NOTDEF;
             out = "<" + start + ">" + *value + "</" + name + ">\n";
         }
@@ -223,6 +221,14 @@ dav_error* addToMethods(request_rec* r, const dav_resource*, apr_text_header* te
 
 const dav_liveprop_group kLiveProperties = {kProperties, kNamespaces, &kHooks};
 const dav_options_provider kOptions = {addToHeader, addToMethods, nullptr};
+
+std::optional<std::string> directoryOf(request_rec* r, const dav_resource* resource) {
+    const std::string_view asked = withoutSlash(r->uri), path = withoutSlash(resource->uri);
+    if (!r->filename || !servesFiles(r) || !path.starts_with(asked)) return std::nullopt;
+    const std::string_view below = path.substr(asked.size());
+    if (!below.empty() && below.front() != '/') return std::nullopt;
+    return std::string(withoutSlash(r->filename)) + std::string(below);
+}
 
 std::optional<std::string> livePropertyElement(const dav_resource* resource, std::string_view name) {
     for (const dav_liveprop_spec* spec = kProperties; spec->name; ++spec) {

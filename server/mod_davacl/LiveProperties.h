@@ -25,6 +25,10 @@ void insertAllLiveProperties(request_rec* r, const dav_resource* resource, dav_p
 // or not for this user.
 std::optional<std::string> livePropertyElement(const dav_resource* resource, std::string_view name);
 
+// The directory that a collection of files is, below or at the one that the request names; nothing where none is
+// served.
+std::optional<std::string> directoryOf(request_rec* r, const dav_resource* resource);
+
 // OPTIONS: "access-control" and the class above in the DAV header, ACL among the methods.
 extern const dav_options_provider kOptions;
 

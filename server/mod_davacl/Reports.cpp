@@ -2,6 +2,7 @@
 
 #include "server/mod_davacl/LiveProperties.h"
 #include "server/mod_davacl/PrincipalResources.h"
+#include "server/mod_davacl/SyncCollection.h"
 #include "server/mod_davacl/WaitingRequests.h"
 #include "server/mod_davacl/XmlElements.h"
 
@@ -351,6 +352,16 @@ void expandProperties(Report& q) {
     }
 }
 
+// -- sync-collection (RFC 6578)
+
+void synchronizeTree(Report& q) {
+    const SyncAnswer answer = synchronize(q.r, q.resource, q.doc, [&q](const dav_resource* member) {
+        return responseOf(q, member, const_cast<apr_xml_doc*>(q.doc), {});
+    });
+    q.error = answer.error;
+    q.text = answer.text;
+}
+
 // -- all of them
 
 void describeSearch(Report& q) {
@@ -358,17 +369,20 @@ void describeSearch(Report& q) {
              "<D:description xml:lang=\"en\">Name</D:description></D:principal-search-property>\n";
 }
 
+enum class On { trees, everything, collections };
 struct Known {
     const char* name;
     void (*answer)(Report&);
-    bool onPrincipals;
+    On on;
     const char* root; // of the answer
 };
-constexpr Known kReports[] = {{"expand-property", expandProperties, true, "multistatus"},
-                              {"acl-principal-prop-set", principalsOfList, false, "multistatus"},
-                              {"principal-match", matchPrincipals, true, "multistatus"},
-                              {"principal-property-search", searchPrincipals, true, "multistatus"},
-                              {"principal-search-property-set", describeSearch, true, "principal-search-property-set"}};
+constexpr Known kReports[] = {
+    {"expand-property", expandProperties, On::everything, "multistatus"},
+    {"acl-principal-prop-set", principalsOfList, On::trees, "multistatus"},
+    {"principal-match", matchPrincipals, On::everything, "multistatus"},
+    {"principal-property-search", searchPrincipals, On::everything, "multistatus"},
+    {"principal-search-property-set", describeSearch, On::everything, "principal-search-property-set"},
+    {"sync-collection", synchronizeTree, On::collections, "multistatus"}};
 
 void send(const Report& q, const Known& report) {
     const std::string text = std::string("<?xml version=\"1.0\" encoding=\"utf-8\"?>\n<D:") + report.root +
@@ -381,7 +395,7 @@ void send(const Report& q, const Known& report) {
 
 int answer(Report& q) {
     for (const Known& report : kReports) {
-        if (!isDav(q.doc->root, report.name) || (!q.resource && !report.onPrincipals)) continue;
+        if (!isDav(q.doc->root, report.name) || (!q.resource && report.on != On::everything)) continue;
         if (dav_get_depth(q.r, 0) != 0)
             q.refuse("The report is about the resource itself: send Depth 0, or none.");
         else
@@ -423,10 +437,11 @@ int reportOnPrincipals(request_rec* r, const Configuration& c) {
                           nullptr);
 }
 
-std::string supportedReports(bool ofTrees) {
+std::string supportedReports(bool ofTrees, bool ofCollections) {
     std::string text;
     for (const Known& report : kReports)
-        if (ofTrees || report.onPrincipals)
+        if (report.on == On::everything || (report.on == On::trees && ofTrees) ||
+            (report.on == On::collections && ofCollections))
             text +=
                 std::string("<D:supported-report><D:report><D:") + report.name + "/></D:report></D:supported-report>";
     return text;

@@ -16,6 +16,6 @@ int reportOnTrees(request_rec* r, const dav_resource* resource, const apr_xml_do
 int reportOnPrincipals(request_rec* r, const Configuration& c);
 
 // The content of DAV:supported-report-set.
-std::string supportedReports(bool ofTrees);
+std::string supportedReports(bool ofTrees, bool ofCollections = false);
 
 } // namespace rolvane::davacl
