@@ -253,9 +253,9 @@ std::string syncToken(Library& library, int64_t number) {
     return std::string(kTokenStart) + library.memory().epoch() + ":" + std::to_string(number);
 }
 
-int64_t numberOfToken(Library& library, const std::string& book, const std::string& token) {
-    const auto unknown = [] {
-        return Refused(HTTP_FORBIDDEN, kDavSpace, "valid-sync-token",
+int64_t numberOfToken(Library& library, const std::string& book, const std::string& token, int refusal) {
+    const auto unknown = [&] {
+        return Refused(refusal, kDavSpace, "valid-sync-token",
                        "The token says nothing here any more: synchronise from the beginning, with an empty one.");
     };
     const std::string start = std::string(kTokenStart) + library.memory().epoch() + ":";

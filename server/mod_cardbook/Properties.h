@@ -25,7 +25,7 @@ std::vector<PropertyName> propertiesOf(const Resource& resource);
 
 // The value of DAV:sync-token for a book at a number.
 std::string syncToken(Library& library, int64_t number);
-// The number of a token of that book. Throws Refused, valid-sync-token, for any other text.
-int64_t numberOfToken(Library& library, const std::string& book, const std::string& token);
+// The number of a token of that book. Throws Refused, valid-sync-token, with the status `refusal` for any other text.
+int64_t numberOfToken(Library& library, const std::string& book, const std::string& token, int refusal);
 
 } // namespace rolvane::cardbook

@@ -8,6 +8,7 @@
 #include "server/mod_cardbook/XmlText.h"
 
 #include <algorithm>
+#include <string_view>
 
 namespace rolvane::cardbook {
 namespace {
@@ -98,7 +99,7 @@ private:
     void syncAtOnce(int64_t& until) {
         BookMemory& memory = _library.memory();
         const bool isFirst = _request.token.empty();
-        const int64_t from = isFirst ? 0 : numberOfToken(_library, book(), _request.token);
+        const int64_t from = isFirst ? 0 : numberOfToken(_library, book(), _request.token, refusalOfToken());
         until = memory.latest(book());
         uint64_t left = std::min<uint64_t>(_request.limit.value_or(kMostResponses), kMostResponses);
         bool isCut = false;
@@ -117,6 +118,13 @@ private:
         if (isCut)
             _answer.addStatus(_resource.path(), HTTP_INSUFFICIENT_STORAGE, "<D:number-of-matches-within-limits/>");
         _answer.add("<D:sync-token>" + syncToken(_library, until) + "</D:sync-token>\n");
+    }
+
+    // Thunderbird begins anew after 400 alone. After 403 it would ask with the same token for ever.
+    int refusalOfToken() const {
+        const char* program = apr_table_get(_resource.r->headers_in, "User-Agent");
+        return program && std::string_view(program).find("Thunderbird/") != std::string_view::npos ? HTTP_BAD_REQUEST
+                                                                                                   : HTTP_FORBIDDEN;
     }
 
     template <class Call>

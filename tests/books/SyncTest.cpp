@@ -145,6 +145,21 @@ TEST(Sync, RefusesTokensThatSayNothing) {
               "sync-traversal-supported");
 }
 
+// Thunderbird begins anew where a token is refused with 400, and with no other status.
+TEST(Sync, RefusesTokensInAWayThatThunderbirdGetsOver) {
+    BooksWorld world;
+    const auto asked = [&](const std::string& program, const std::string& level) {
+        return world.ask("REPORT", kContacts, {{"Content-Type", "application/xml"}, {"User-Agent", program}},
+                         "<D:sync-collection xmlns:D=\"DAV:\"><D:sync-token>urn:else</D:sync-token><D:sync-level>" +
+                             level + "</D:sync-level><D:prop/></D:sync-collection>");
+    };
+    const std::string thunderbird = "Mozilla/5.0 (X11; Linux x86_64; rv:153.0) Gecko/20100101 Thunderbird/153.7.0";
+    EXPECT_EQ(asked(thunderbird, "1").status, 400);
+    EXPECT_EQ(asked(thunderbird, "1").precondition(), "valid-sync-token");
+    EXPECT_EQ(asked("Evolution/3.46", "1").status, 403);
+    EXPECT_EQ(asked(thunderbird, "infinite").status, 403) << "another precondition";
+}
+
 TEST(Sync, GoesOnOnAnEarlierCopyOfTheDatabaseAndKeepsTheNames) {
     test::TempDirectory directory;
     const std::string path = directory / "contacts.db";
