@@ -103,6 +103,9 @@ TEST(Books, ShowEveryOwnPersonAndGroupAsACard) {
     EXPECT_THAT(group.body, HasSubstr("KIND:group"));
     EXPECT_THAT(group.body, HasSubstr("MEMBER:urn:uuid:" + BooksWorld::uuidOf(ann)));
     EXPECT_THAT(group.body, Not(HasSubstr(BooksWorld::uuidOf(bob))));
+    const auto older = world.ask("GET", hrefOf(friends), {{"Accept", "text/vcard;version=3.0"}});
+    EXPECT_THAT(older.body, HasSubstr("X-ADDRESSBOOKSERVER-KIND:group\r\n")) << "as phones know groups";
+    EXPECT_THAT(older.body, HasSubstr("X-ADDRESSBOOKSERVER-MEMBER:urn:uuid:" + BooksWorld::uuidOf(ann)));
     EXPECT_EQ(world.ask("GET", hrefOf(ann), {{"If-None-Match", got.tag()}}).status, 304);
     EXPECT_EQ(world.ask("GET", std::string(kContacts) + "nobody.vcf").status, 404);
     EXPECT_EQ(world.ask("PROPFIND", "/books/home/other/", {{"Depth", "0"}}).status, 404);

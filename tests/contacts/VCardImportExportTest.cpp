@@ -392,7 +392,7 @@ TEST(VCardExport, TheTextHoldsNothingButCardsOfTheVersion) {
     EXPECT_NE(exportAll(*db, VCardVersion::v4).find("VERSION:4.0\r\nUID:"), std::string::npos);
     EXPECT_NE(exportAll(*db, VCardVersion::v4).find("KIND:group\r\n"), std::string::npos);
     EXPECT_EQ(exportAll(*db, VCardVersion::v3).find("VERSION:4.0"), std::string::npos);
-    EXPECT_NE(exportAll(*db, VCardVersion::v3).find("X-ROLVANE-KIND:group\r\n"), std::string::npos);
+    EXPECT_NE(exportAll(*db, VCardVersion::v3).find("X-ADDRESSBOOKSERVER-KIND:group\r\n"), std::string::npos);
 }
 
 TEST(VCardDemo, TheDemonstrationsFileGoesInWithoutAnError) {

@@ -1,5 +1,5 @@
-"""Two CardDAV clients and a subscriber change the same contacts at once, while the server of the books and the owner's
-daemon are killed again and again. Nothing may be lost, and nothing doubled."""
+"""Two CardDAV clients and a subscriber change the same contacts at once, while the server of the books and both people's
+daemons are killed again and again. Nothing may be lost, and nothing doubled."""
 
 import os
 import random
@@ -212,13 +212,14 @@ def kills(build, root, make_owner, check, edits, seed):
         writers = clients + [Subscriber(subscriber, words, edits, f"{seed} bob")]
         for writer in writers:
             writer.start()
-        count = {"httpd": 0, "a worker of httpd": 0, "daemon": 0}
+        daemons = {"the owner's daemon": owner, "the subscriber's daemon": subscriber}
+        count = {"httpd": 0, "a worker of httpd": 0, **{name: 0 for name in daemons}}
         while any(writer.is_alive() for writer in writers) or not all(count.values()):
             what, pid = chance.choice(list(count)), None
-            if what == "daemon":
-                asked = owner.start("sync", stdout=subprocess.DEVNULL, stderr=subprocess.DEVNULL)
+            if what in daemons:
+                asked = daemons[what].start("sync", stdout=subprocess.DEVNULL, stderr=subprocess.DEVNULL)
                 while not pid and asked.poll() is None:
-                    pid = owner.daemon()
+                    pid = daemons[what].daemon()
             else:
                 pid = owner.json("books", "status", may=(0, 3)).get("process")
             time.sleep(chance.uniform(0, 0.3))  # a random moment
@@ -231,7 +232,7 @@ def kills(build, root, make_owner, check, edits, seed):
             count[what] += bool(pid)
             if what == "httpd":
                 owner.run("books", "on")
-            if what == "daemon":
+            if what in daemons:
                 asked.wait()
         for writer in writers:
             writer.join()

@@ -18,6 +18,10 @@ namespace rolvane {
 
 namespace {
 
+// Version 3.0 has no groups. These lines are what phones and other address books write and understand instead.
+constexpr const char* kGroupKind3 = "X-ADDRESSBOOKSERVER-KIND";
+constexpr const char* kGroupMember3 = "X-ADDRESSBOOKSERVER-MEMBER";
+
 // In the order in which a person expects to see them.
 constexpr const char* kMultiOrder[] = {kCXPhoneProperty,     kCXEmailProperty,          kCXAddressProperty,
                                        kCXURLsProperty,      kCXInstantMessageProperty, kCXRelatedNamesProperty,
@@ -201,7 +205,7 @@ private:
     void emitKind() {
         VCardLine line = single("KIND");
         const bool plain = line.group.empty() && line.parameters.empty();
-        line.name = _v4 ? "KIND" : "X-ROLVANE-KIND";
+        line.name = _v4 ? "KIND" : _entity.isGroup ? kGroupKind3 : "X-ROLVANE-KIND";
         if (line.value != "individual" || !plain) emit(std::move(line));
     }
 
@@ -411,7 +415,7 @@ private:
         emitSingle("FN", true);
         if (!_v4) emit("N", vcardEncodeSingle("FN", _p, true) + ";;;;");
         emitSingle("NOTE");
-        for (const auto& m : _entity.members) emitMember(_v4 ? "MEMBER" : "X-ROLVANE-MEMBER", m);
+        for (const auto& m : _entity.members) emitMember(_v4 ? "MEMBER" : kGroupMember3, m);
         for (const auto& g : _entity.subgroups) emitMember("X-ROLVANE-SUBGROUP", g);
         for (const auto& c : _entity.choices) {
             VCardLine line;
