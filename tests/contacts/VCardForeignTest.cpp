@@ -178,7 +178,7 @@ TEST(VCardForeign, MembersWithoutACardAreKeptAndJoinWhenTheirCardsCome) {
     const std::string four = exportAll(*db, VCardVersion::v4), three = exportAll(*db, VCardVersion::v3);
     for (const char* uid : {"urn:uuid:00000000-0000-4000-8000-00000000000a", "someone@example.org"}) {
         EXPECT_TRUE(contains(four, std::string("MEMBER:") + uid)) << four;
-        EXPECT_TRUE(contains(three, std::string("X-ROLVANE-MEMBER:") + uid)) << three;
+        EXPECT_TRUE(contains(three, std::string("X-ADDRESSBOOKSERVER-MEMBER:") + uid)) << three;
     }
     importText(*db, card("UID:someone@example.org\r\nFN:Someone\r\n"));
     for (const auto& listing : db->listGroups(RemoteLocation(""))) {
