@@ -81,6 +81,8 @@ bench:
 	bench/signin.py build/bench
 	bench/naming.py build/bench
 	bench/subscribers.py build/bench
+	bench/books.py build/bench
+	bench/bookput.py build/bench
 
 lint:
 	@packaging/setup build test lint

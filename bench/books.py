@@ -21,6 +21,7 @@ from benchworld import write_cards  # noqa: E402
 BUILD = os.path.abspath(sys.argv[1])
 PEOPLE = int(sys.argv[2]) if len(sys.argv) > 2 else 100000
 CLI = os.environ.get("ROLVANE_CLI", os.path.join(BUILD, "apps/rolvane/rolvane"))
+CARDS_A_SECOND, CHANGE_SECONDS, CHANGE_BYTES, MEGABYTES = 10000, 0.005, 10000, 100
 TICK = os.sysconf("SC_CLK_TCK")
 BOOK = "/books/home/contacts/"
 SPACES = 'xmlns:D="DAV:" xmlns:C="urn:ietf:params:xml:ns:carddav"'
@@ -115,12 +116,15 @@ def main():
                 break
             except ConnectionRefusedError:
                 time.sleep(0.01)
-        measure(Client(port), Worker(httpd.pid), environment)
+        failures = measure(Client(port), Worker(httpd.pid), environment)
     finally:
         if httpd:
             httpd.terminate()
             httpd.wait()
         shutil.rmtree(directory)
+    for failure in failures:
+        print(f"FAILED: {failure}")
+    return 1 if failures else 0
 
 
 def sync(client, token=""):
@@ -131,10 +135,14 @@ def sync(client, token=""):
 
 
 def measure(client, worker, environment):
+    failures = []
+
     def timed(what, call, cards=0):
         cpu, start = worker.cpu(), time.monotonic()
         result = call()
         used, wall = worker.cpu() - cpu, time.monotonic() - start
+        if cards and used and cards / used < CARDS_A_SECOND:
+            failures.append(f"{what}: less than {CARDS_A_SECOND:,} cards a second")
         rate = f", {cards / used:,.0f} cards a second of CPU" if cards and used else ""
         print(f"{what}: {wall:.2f} s, CPU {used:.2f} s{rate}; memory {worker.memory('VmRSS'):.0f} MB now, "
               f"{worker.memory():.0f} MB at most")
@@ -173,6 +181,12 @@ def measure(client, worker, environment):
     times.sort()
     print(f"a change later, sync-collection and multiget: {times[10] * 1000:.1f} ms (median of 20, {times[-1] * 1000:.1f} "
           f"at most), {max(sizes)} bytes")
+    if times[10] > CHANGE_SECONDS or max(sizes) > CHANGE_BYTES:
+        failures.append(f"a change costs more than {CHANGE_SECONDS * 1000:.0f} ms or {CHANGE_BYTES} bytes")
+    if worker.memory() > MEGABYTES:
+        failures.append(f"the worker takes more than {MEGABYTES} MB")
+    return failures
 
 
-main()
+if __name__ == "__main__":
+    sys.exit(main())
