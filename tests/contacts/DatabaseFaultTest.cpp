@@ -15,11 +15,11 @@ namespace {
 TEST(DatabaseFault, AFileOfANewerFormatIsRefusedAndLeftAlone) {
     TestDatabase d;
     d.database.reset();
-    Sqlite(d.path, 0).execute("PRAGMA user_version=8");
+    Sqlite(d.path, 0).execute("PRAGMA user_version=9");
     std::string told = reasonOf([&] { d.open(); });
     EXPECT_TELLS(told, "newer version");
     EXPECT_TELLS(told, d.path);
-    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 8);
+    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 9);
 }
 
 TEST(DatabaseFault, AFileOfTheFormerFormatLearnsWhoWroteWhat) {
@@ -35,7 +35,7 @@ TEST(DatabaseFault, AFileOfTheFormerFormatLearnsWhoWroteWhat) {
     d->save();
     EXPECT_EQ(d->personRow(UniqueId("A:CXPerson"))->writer, "rolvane");
     d.database.reset();
-    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 7);
+    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 8);
 }
 
 TEST(DatabaseFault, AFileOfTheFormatBeforeNamesItsGroupsMembers) {
@@ -50,7 +50,7 @@ TEST(DatabaseFault, AFileOfTheFormatBeforeNamesItsGroupsMembers) {
     EXPECT_EQ(friends->memberUniqueIds(), std::vector{UniqueId("A:CXPerson")});
     EXPECT_EQ(friends->memberCount(), 1u);
     d.database.reset();
-    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 7);
+    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 8);
 }
 
 TEST(DatabaseFault, AFileOfTheFormatBeforeKeepsWhatEditedContactsWere) {
@@ -68,7 +68,7 @@ TEST(DatabaseFault, AFileOfTheFormatBeforeKeepsWhatEditedContactsWere) {
     d->save();
     EXPECT_EQ(d->editedSinceCommon(), std::vector{ada});
     d.database.reset();
-    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 7);
+    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 8);
 }
 
 TEST(DatabaseFault, AFileOfTheFormatBeforeFindsPeopleByTheirNames) {
@@ -91,7 +91,7 @@ TEST(DatabaseFault, AFileOfTheFormatBeforeFindsPeopleByTheirNames) {
         d->rollback();
     }
     d.database.reset();
-    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 7);
+    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 8);
 }
 
 TEST(DatabaseFault, AnotherProgramsFileIsRefusedAndLeftAlone) {

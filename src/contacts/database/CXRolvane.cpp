@@ -35,7 +35,7 @@ CXRolvane::Impl::Impl(CXRolvane& owner, Options given)
       sqlite(RecordStore::makeIfMissing(options.path, options.busyTimeoutMilliseconds),
              options.busyTimeoutMilliseconds),
       store(sqlite), journal(sqlite), commonVersions(sqlite), conflicts(sqlite), formerVersions(sqlite),
-      identity(store.identity()), anchor(std::make_shared<CXRolvane* const>(&owner)) {}
+      changeLog(sqlite), identity(store.identity()), anchor(std::make_shared<CXRolvane* const>(&owner)) {}
 
 CXRolvane::CXRolvane(Options options) : _impl(std::make_unique<Impl>(*this, std::move(options))) {
     if (!_impl->options.runLoop) return;

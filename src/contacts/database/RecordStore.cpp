@@ -1,5 +1,6 @@
 #include "contacts/database/RecordStore.h"
 
+#include "contacts/database/ChangeLog.h"
 #include "contacts/database/CommonVersions.h"
 #include "contacts/database/ConflictLog.h"
 #include "contacts/database/DaemonMemory.h"
@@ -22,7 +23,7 @@ namespace rolvane {
 
 namespace {
 
-constexpr int kFormat = 7;
+constexpr int kFormat = 8;
 constexpr int64_t kApplicationId = 0x52564c43; // "RVLC"
 
 constexpr const char* kTables = R"(
@@ -165,6 +166,7 @@ void RecordStore::makeOrCheckFormat() {
     if (format == 4) format = addDisplayNames();
     if (format == 5) format = addDaemonMemory();
     if (format == 6) format = addSearchTexts();
+    if (format == 7) format = addChangeLog();
     if (format > kFormat)
         throw CXException(kCXDatabaseException, "The contact database " + _database.path() +
                                                     " was written by a newer version (format " +
@@ -244,8 +246,18 @@ int64_t RecordStore::addSearchTexts() {
     return _database.integer("PRAGMA user_version");
 }
 
+// Format 7 did not keep what changes had changed.
+int64_t RecordStore::addChangeLog() {
+    SqliteTransaction transaction(_database);
+    if (_database.integer("PRAGMA user_version") == 7) // nobody else did it meanwhile
+        _database.execute(std::string(ChangeLog::kTable) + "PRAGMA user_version=8;");
+    transaction.commit();
+    return _database.integer("PRAGMA user_version");
+}
+
 void RecordStore::fillNewDatabase() {
-    _database.execute(std::string(kTables) + CommonVersions::kTable + ConflictLog::kTable + MemoryTable::kTable);
+    _database.execute(std::string(kTables) + CommonVersions::kTable + ConflictLog::kTable + MemoryTable::kTable +
+                      ChangeLog::kTable);
     _database.execute("PRAGMA application_id=" + std::to_string(kApplicationId));
     _database.execute("PRAGMA user_version=" + std::to_string(kFormat));
     _database.statement("INSERT INTO meta VALUES('identity', ?)").bind(1, makeUUID()).run();

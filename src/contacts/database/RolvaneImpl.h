@@ -1,6 +1,7 @@
 #pragma once
 
 #include "contacts/database/CXRolvane.h"
+#include "contacts/database/ChangeLog.h"
 #include "contacts/database/ChangeWatcher.h"
 #include "contacts/database/CommonVersions.h"
 #include "contacts/database/ConflictLog.h"
@@ -31,6 +32,7 @@ struct CXRolvane::Impl {
     CommonVersions commonVersions;
     ConflictLog conflicts;
     FormerVersions formerVersions;
+    ChangeLog changeLog;
     UnitOfWork work;
     std::string identity;
     std::shared_ptr<CXRolvane* const> anchor; // handles hold it weakly

@@ -18,12 +18,16 @@ class Saver {
 public:
     Saver(CXRolvane::Impl& database, Date date)
         : _store(database.store), _journal(database.journal), _commonVersions(database.commonVersions),
-          _conflicts(database.conflicts), _formerVersions(database.formerVersions), _identity(database.identity),
-          _program(database.options.program), _date(date) {}
+          _conflicts(database.conflicts), _formerVersions(database.formerVersions), _log(database.changeLog),
+          _identity(database.identity), _program(database.options.program), _date(date) {}
 
     void write(const UnitOfWork& work) {
         _work = &work;
+        _log.begin(_program, _date);
         auto records = work.inOrder();
+        for (const auto& [uid, record] : records)
+            if (record->deleted && record->kind == RecordKind::subscription)
+                if (const std::optional<StoredRow> row = _store.row(uid)) _endedLocations.insert(row->location);
         for (const auto& [uid, record] : records)
             if (record->deleted || record->purged) removeRecord(uid, *record);
         for (const auto& [uid, record] : records)
@@ -34,6 +38,7 @@ public:
         if (work.shareCount()) _store.setShareCount(*work.shareCount());
         if (_save) _journal.prune();
         if (_keptFormer) _formerVersions.prune();
+        _log.finish();
     }
     bool changedRecords() const { return _save != 0; }
 
@@ -44,7 +49,33 @@ private:
         _noted.insert(uid);
     }
 
+    static bool isLogged(RecordKind kind) { return !isAllKind(kind) && (isPerson(kind) || isGroup(kind)); }
+
+    // The record last: what is taken back begins with it.
+    void logRemoval(const StoredRow& row) {
+        if (!isLogged(row.kind) || (cxIsSubscribed(row.uid) && _endedLocations.contains(row.location))) return;
+        for (const auto& [number, group] : _store.parents(row.uid)) _log.note(row.uid, CXDetailKind::left, group);
+        if (isPerson(row.kind)) {
+            for (const StoredChoice& choice : _store.choicesOfPerson(row.uid))
+                logChoice(row.uid, choice.record, choice.property, choice.identifier);
+        } else {
+            for (const auto& [member, kind] : _store.listed(row.uid)) _log.note(member, CXDetailKind::left, row.uid);
+            for (const StoredChoice& choice : _store.choicesOfGroup(row.uid))
+                logChoice(choice.record, row.uid, choice.property, choice.identifier);
+        }
+        _log.note(row.uid, CXDetailKind::deleted, {}, row.properties.get());
+    }
+
+    void logChoice(const UniqueId& person, const UniqueId& group, const std::string& property,
+                   const std::optional<std::string>& before) {
+        Dictionary choice{{"property", property}};
+        if (before) choice.set("identifier", *before);
+        const Bytes encoded = BinaryValue::encode(choice);
+        _log.note(person, CXDetailKind::chosen, group, &encoded);
+    }
+
     void removeRow(const StoredRow& row) {
+        logRemoval(row);
         _store.touchParents(row.id, _date);
         _store.removeRow(row.id);
     }
@@ -77,6 +108,7 @@ private:
             Dictionary properties = record.over({});
             _store.insertRow(uid, record.kind, properties, encodedOf(record, properties), _date, _program);
             if (!isAllKind(record.kind)) note(uid, CXChangeKind::inserted);
+            if (isLogged(record.kind)) _log.note(uid, CXDetailKind::added);
             return;
         }
         if (!row) {
@@ -128,6 +160,7 @@ private:
         if (isPerson(row.kind) && !_work->commonVersions().contains(uid))
             _commonVersions.keep(row.id, *row.properties, _date);
         keepFormer(row);
+        if (isLogged(row.kind)) _log.note(row.uid, CXDetailKind::changed, {}, row.properties.get());
         _store.updateRow(row.id, record.kind, after, encoded, _date,
                          changedMeanwhile ? row.writer : _program); // it holds an edit of theirs
         note(record.kind == RecordKind::allGroup ? UniqueId(_identity + ":" + std::string(kCXInfoTable)) : uid,
@@ -164,16 +197,22 @@ private:
 
     void takeOut(GroupToWrite& group) {
         for (const UniqueId& member : group.changes.removed)
-            group.changed |= _store.removeListed(group.number, _store.rowNumber(member));
-        for (const UniqueId& person : group.changes.choicesDropped)
+            if (_store.removeListed(group.number, _store.rowNumber(member))) {
+                group.changed = true;
+                _log.note(member, CXDetailKind::left, group.uid);
+            }
+        for (const UniqueId& person : group.changes.choicesDropped) {
+            for (const StoredChoice& choice : _store.choicesOfPerson(person))
+                if (choice.record == group.uid) logChoice(person, group.uid, choice.property, choice.identifier);
             group.changed |= _store.removeChoices(group.number, _store.rowNumber(person));
+        }
     }
 
     void putIn(GroupToWrite& group) {
         for (const UniqueId& member : group.changes.added)
             if (!member.empty()) group.changed |= addMember(group.uid, group.number, member);
         for (const auto& [person, chosen] : group.changes.choices)
-            group.changed |= writeChoices(group.number, person, chosen);
+            group.changed |= writeChoices(group.uid, group.number, person, chosen);
     }
 
     void noteContents(const GroupToWrite& group) {
@@ -192,17 +231,24 @@ private:
                   group);
             return false;
         }
-        return _store.addListed(number, row);
+        if (!_store.addListed(number, row)) return false;
+        _log.note(member, CXDetailKind::joined, group);
+        return true;
     }
 
-    bool writeChoices(int64_t group, const UniqueId& person,
+    bool writeChoices(const UniqueId& uid, int64_t group, const UniqueId& person,
                       const std::map<std::string, std::optional<std::string>>& chosen) {
         int64_t number = _store.rowNumber(person);
         if (number == 0) return false;
         bool changed = false;
-        for (const auto& [property, identifier] : chosen)
-            changed |= identifier ? _store.setChoice(group, number, property, *identifier)
-                                  : _store.removeChoice(group, number, property);
+        for (const auto& [property, identifier] : chosen) {
+            const std::optional<std::string> before = _store.choice(uid, person, property);
+            if (identifier ? !_store.setChoice(group, number, property, *identifier)
+                           : !_store.removeChoice(group, number, property))
+                continue;
+            changed = true;
+            logChoice(person, uid, property, before);
+        }
         return changed;
     }
 
@@ -211,6 +257,7 @@ private:
     CommonVersions& _commonVersions;
     ConflictLog& _conflicts;
     FormerVersions& _formerVersions;
+    ChangeLog& _log;
     const std::string& _identity;
     const std::string& _program;
     Date _date;
@@ -219,6 +266,7 @@ private:
     std::optional<bool> _areFormerKept;
     bool _keptFormer = false;
     std::set<UniqueId> _noted;
+    std::set<std::string> _endedLocations; // of subscriptions that end with this save
 };
 
 } // namespace
@@ -271,6 +319,7 @@ bool CXRolvane::Impl::saveWith(const PreferencesChanges& values, const std::vect
         scans = scansBefore;
         throw;
     }
+    changeLog.wasCommitted();
     moveTo.reset();
     work.clear();
     store.noteOwnWrite();
