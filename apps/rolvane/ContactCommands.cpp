@@ -12,6 +12,7 @@
 #include "Subscriptions.h"
 #include "ValueNames.h"
 
+#include "contacts/database/History.h"
 #include "contacts/vcard/TextCharset.h"
 #include "contacts/vcard/VCardExport.h"
 #include "contacts/vcard/VCardImport.h"
@@ -316,7 +317,7 @@ std::string deletionOf(CXRolvane& database, const std::vector<CXPersonRef>& peop
     return question;
 }
 
-void remove(Context& context, const std::vector<std::string>& names, bool yes) {
+void remove(Context& context, const std::vector<std::string>& names, bool yes, bool purge) {
     CXRolvane& database = context.database();
     std::vector<CXPersonRef> people;
     for (const std::string& name : names) {
@@ -326,9 +327,16 @@ void remove(Context& context, const std::vector<std::string>& names, bool yes) {
         if (std::none_of(people.begin(), people.end(), same)) people.push_back(person);
     }
     requireConsent(context, yes, deletionOf(database, people), "Nothing was deleted.");
-    for (const CXPersonRef& person : people) database.removeRecord(person);
+    std::vector<UniqueId> deleted;
+    for (const CXPersonRef& person : people) {
+        deleted.push_back(person->uniqueId());
+        database.removeRecord(person);
+    }
     database.save();
-    context.say(counted(people.size(), "person", "people") + " deleted.");
+    if (purge)
+        for (const UniqueId& uid : deleted) CXHistory(database).forget(uid);
+    context.say(counted(people.size(), "person", "people") + " deleted." +
+                (purge ? "" : " `rolvane undo` brings back."));
 }
 
 } // namespace
@@ -428,14 +436,15 @@ void addContactCommands(CLI::App& app, Context& context) {
         [&context, edited, named] { edit(context, *named, *edited); });
 
     const auto deleted = std::make_shared<std::vector<std::string>>();
-    const auto yes = std::make_shared<bool>(false);
+    const auto yes = std::make_shared<bool>(false), purge = std::make_shared<bool>(false);
     addCommand(
         app, context, "delete", "Delete people; a part of a name is not enough",
         [&](CLI::App& command) {
             command.add_option("names", *deleted, "Names or identifiers")->required()->type_name(kPersonValue);
             declareConsent(command, *yes);
+            command.add_flag("--purge", *purge, "Keep nothing of them in the log either: they cannot be brought back");
         },
-        [&context, deleted, yes] { remove(context, *deleted, *yes); });
+        [&context, deleted, yes, purge] { remove(context, *deleted, *yes, *purge); });
 }
 
 } // namespace rolvane::cli

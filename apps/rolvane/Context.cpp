@@ -7,6 +7,7 @@
 
 #include "contacts/database/DaemonMemory.h"
 #include "contacts/database/DamagedDatabase.h"
+#include "contacts/database/History.h"
 #include "daemon/InstanceLock.h"
 #include "foundation/Preferences.h"
 
@@ -50,6 +51,7 @@ CXRolvane& Context::database() {
         options.distributed = &bus();
         requireKnownDatabase(options.path, Preferences::shared());
         CXRolvane::configureShared(options);
+        CXHistory(CXRolvane::sharedRolvane()).savesAreOne(command);
         _impl->opened = true;
     }
     return CXRolvane::sharedRolvane();
@@ -123,7 +125,11 @@ CLI::App* addCommand(CLI::App& parent, Context& context, const std::string& name
     command->add_flag("--json", context.json, "Print data as one JSON document");
     command->add_flag("-q,--quiet", context.quiet, "No messages but errors");
     if (declare) declare(*command);
-    if (body) command->final_callback(std::move(body));
+    if (body)
+        command->final_callback([&context, path = pathOf(*command), body = std::move(body)] {
+            context.command = path;
+            body();
+        });
     return command;
 }
 

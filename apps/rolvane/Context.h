@@ -43,9 +43,10 @@ public:
     Context();
     ~Context();
 
-    bool json = false;  // --json, accepted before and behind the command's name
-    bool quiet = false; // --quiet: no talk but errors
-    int exitCode = kOk; // what the command ends with when nothing is thrown
+    bool json = false;   // --json, accepted before and behind the command's name
+    bool quiet = false;  // --quiet: no talk but errors
+    std::string command; // which one runs: "group add"
+    int exitCode = kOk;  // what the command ends with when nothing is thrown
 
     CXRolvane& database(); // the user's contact database
     DaemonLink& bus();     // the session bus and the daemon's socket, as far as there are any

@@ -51,10 +51,15 @@ const std::map<std::string, const char*>& examples() {
                         "      --password-command 'pass show dav.example.org'\n"
                         "  rolvane account set --password-file ~/.config/rolvane/password"},
         {"account test", "  rolvane account test && rolvane publish"},
+        {"log", "  rolvane log\n"
+                "  rolvane log \"Ada Miller\"\n"
+                "  rolvane log \"Ada Miller\" --purge --yes"},
+        {"undo", "  rolvane undo\n"
+                 "  rolvane undo 12 --dry-run"},
         {"plan", "  rolvane plan\n"
-                 "  rolvane publish --dry-run\n"
-                 "  rolvane import friends.vcf --dry-run"},
+                 "  rolvane plan --json"},
         {"publish", "  rolvane publish\n"
+                    "  rolvane publish --dry-run\n"
                     "  rolvane publish --group Family"},
         {"unpublish", "  rolvane unpublish --group Family\n"
                       "  rolvane unpublish --keep\n"

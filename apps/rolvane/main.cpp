@@ -2,6 +2,7 @@
 #include "Completion.h"
 #include "Context.h"
 #include "HelpCommand.h"
+#include "LogCommands.h"
 #include "ManualCommand.h"
 #include "PlanCommand.h"
 #include "SafeText.h"
@@ -105,6 +106,7 @@ int main(int argc, char** argv) {
     addDatabaseCommands(app, context);
     addSeeingCommands(app, context);
     addPlanCommand(app, context);
+    addLogCommands(app, context);
     addHelpCommand(app, context);
 
     try {
