@@ -40,8 +40,7 @@ struct CXLoggedChange {
 // subscription is not in it: subscribing brings that back.
 class ChangeLog {
 public:
-    explicit ChangeLog(Sqlite& database, int64_t bytesKept = kBytesKept)
-        : _database(database), _bytesKept(bytesKept) {}
+    explicit ChangeLog(Sqlite& database, int64_t bytesKept = kBytesKept) : _database(database), _bytesKept(bytesKept) {}
 
     static constexpr double kSecondsKept = 30 * 86400.0;
     static constexpr int64_t kBytesKept = 128 << 20;
