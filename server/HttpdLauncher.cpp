@@ -24,6 +24,7 @@ namespace {
 using namespace std::chrono_literals;
 
 constexpr auto kStartDeadline = 10s;
+constexpr std::chrono::milliseconds kLookInterval = 20ms; // where nothing tells of files
 constexpr size_t kLongestProcessNumber = 32;
 constexpr size_t kLongestExplanation = 2000;
 
@@ -32,19 +33,21 @@ size_t sizeOf(const std::string& path) {
     return lstat(path.c_str(), &info) == 0 ? static_cast<size_t>(info.st_size) : 0;
 }
 
-// Reports when a file appears in a directory.
+// Reports when a file may have appeared in a directory.
 class DirectoryWatch {
 public:
     explicit DirectoryWatch(const std::string& directory) : _events(inotify_init1(IN_CLOEXEC | IN_NONBLOCK)) {
-        if (!_events ||
+        if (_events &&
             inotify_add_watch(_events.get(), directory.c_str(), IN_CREATE | IN_MOVED_TO | IN_CLOSE_WRITE) < 0)
-            throw CXException(kCXPrivateStoreException,
-                              "httpd's directory " + directory + " cannot be watched: " + std::strerror(errno) + ".");
+            _events = FileHandle();
     }
-    // Until something happened in the directory, the process ended, or the time ran out.
+    // Until something happened in the directory, the process ended, or the time ran out. A user has a number of watches
+    // and no more; without one it is time to look again soon.
     void wait(const StoreProcess& process, std::chrono::milliseconds timeout) const {
-        pollfd descriptors[] = {{_events.get(), POLLIN, 0}, {process.handle(), POLLIN, 0}};
-        poll(descriptors, 2, static_cast<int>(std::max<long>(timeout.count(), 0)));
+        if (!_events) timeout = std::min(timeout, kLookInterval);
+        pollfd descriptors[] = {{process.handle(), POLLIN, 0}, {_events.get(), POLLIN, 0}};
+        poll(descriptors, _events ? 2 : 1, static_cast<int>(std::max<long>(timeout.count(), 0)));
+        if (!_events) return;
         char drained[4096];
         while (read(_events.get(), drained, sizeof drained) > 0) {
         }

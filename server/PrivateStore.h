@@ -28,7 +28,9 @@ struct PrivateStoreOptions {
 
     int processes = 1; // at start; grows up to maximumProcesses
     int maximumProcesses = 4;
-    int threadsPerProcess = 32;
+    // httpd closes every kept connection of a process whose threads are all at work, and their clients come back with a
+    // TLS handshake each, which is more work. So there are more threads than the processors need.
+    int threadsPerProcess = 128;
     int keepAliveSeconds = 15;
     int maximumKeepAliveRequests = 0;            // 0 = no limit
     int passwordCost = 10;                       // of bcrypt (PasswordFile.h); not kept from one start to the next

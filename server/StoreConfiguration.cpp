@@ -22,6 +22,9 @@ std::string switches(const PrivateStoreOptions& options) {
     return text;
 }
 
+// Of stores that earlier versions started, where nobody could choose it.
+constexpr int kEarlierThreadsPerProcess = 32;
+
 constexpr const char* kAuthenticationNames[] = {"none", "basic", "digest"};
 
 Array toArray(const std::vector<std::string>& texts) {
@@ -74,8 +77,8 @@ std::string renderStoreConfiguration(const std::string& templateText, const Priv
                      {"PROCESSES", std::to_string(processes)},
                      {"SERVER_LIMIT", std::to_string(2 * limit)},
                      {"THREADS", std::to_string(threads)},
-                     // An eighth of all connections of the process, so that there is room for others.
-                     {"NEWCOMERS", std::to_string(8 * threads)},
+                     // A sixteenth of all connections of the process, so that there is room for others.
+                     {"NEWCOMERS", std::to_string(4 * threads)},
                      {"SPARE_THREADS", std::to_string(std::max(threads / 2, 1))},
                      {"WORKERS", std::to_string(threads * limit)},
                      {"KEEPALIVE_TIMEOUT", std::to_string(std::max(options.keepAliveSeconds, 1))},
@@ -137,7 +140,9 @@ PrivateStoreOptions storeOptionsFromDictionary(const Dictionary& d) {
     readInteger("port", options.port);
     readInteger("processes", options.processes);
     readInteger("maximumProcesses", options.maximumProcesses);
+    const int threads = options.threadsPerProcess;
     readInteger("threadsPerProcess", options.threadsPerProcess);
+    if (options.threadsPerProcess == kEarlierThreadsPerProcess) options.threadsPerProcess = threads;
     // Earlier versions kept 60, which nobody had asked for.
     const int longest = options.keepAliveSeconds; // seconds
     readInteger("keepAliveSeconds", options.keepAliveSeconds);

@@ -4,6 +4,7 @@
 #include "foundation/Paths.h"
 #include "server/StoreConfiguration.h"
 #include "server/StoreProcess.h"
+#include "support/WithoutInotify.h"
 
 #include <arpa/inet.h>
 #include <chrono>
@@ -70,6 +71,13 @@ std::string entityTagOf(const HTTPAnswer& answer) {
 
 constexpr const char* kLockBody = "<?xml version=\"1.0\"?><D:lockinfo xmlns:D=\"DAV:\"><D:lockscope><D:exclusive/>"
                                   "</D:lockscope><D:locktype><D:write/></D:locktype></D:lockinfo>";
+
+TEST(PrivateStoreLife, BeginsWhereThereIsNoWatchOfDirectories) {
+    test::withoutInotify([] {
+        const World world;
+        EXPECT_EQ(world.alice().request("PUT", "/alice/x", {}, "x").status, 201);
+    });
+}
 
 TEST(PrivateStore, AnswersAsAClassTwoStoreOverTLSFromItsOwnAuthority) {
     const World world;

@@ -78,6 +78,12 @@ TEST(StoreConfiguration, OptionsSurviveBeingKept) {
     EXPECT_TRUE(storeOptionsToDictionary(back, 4711) == kept);
 }
 
+TEST(StoreConfiguration, TakesTheThreadsOfToday) {
+    Dictionary kept;
+    kept.set("threadsPerProcess", 32); // every store that an earlier version started
+    EXPECT_EQ(storeOptionsFromDictionary(kept).threadsPerProcess, PrivateStoreOptions().threadsPerProcess);
+}
+
 TEST(StoreConfiguration, WhatIsMissingTakesItsDefault) {
     EXPECT_TRUE(storeOptionsToDictionary(storeOptionsFromDictionary(Dictionary()), 0) ==
                 storeOptionsToDictionary(PrivateStoreOptions(), 0));

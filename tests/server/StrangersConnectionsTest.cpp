@@ -171,6 +171,35 @@ TEST(PiecesOfARequest, AreAnsweredHoweverManyTLSRecordsTheyAre) {
     EXPECT_EQ(alice.request("GET", "/alice/x").body, "abcdefghij");
 }
 
+// httpd closes all kept connections of a process whose threads are all at work.
+TEST(SlowUploads, CloseNobodysKeptConnection) {
+    constexpr int kUploads = 60;
+    const StoreDirectory directory;
+    PrivateStoreOptions options = optionsIn(directory);
+    options.maximumProcesses = 1;
+    PrivateStore store(options);
+    store.addUser("alice", "word");
+    store.start();
+    const std::string signIn = " HTTP/1.1\r\nHost: localhost\r\nAuthorization: Basic YWxpY2U6d29yZA==\r\n";
+    const std::string looking = "OPTIONS /dav/alice/" + signIn + "\r\n";
+    TLSConnection kept(store.status().port);
+    kept.write(looking);
+    ASSERT_EQ(kept.answers(1), std::vector<int>{200});
+    std::vector<std::unique_ptr<TLSConnection>> uploads;
+    for (int i = 0; i < kUploads; ++i) {
+        uploads.push_back(std::make_unique<TLSConnection>(store.status().port));
+        const std::string path = "PUT /dav/alice/f" + std::to_string(i);
+        uploads.back()->write(path + signIn + "Expect: 100-continue\r\nContent-Length: 2\r\n\r\n");
+        ASSERT_EQ(uploads.back()->answers(1), std::vector<int>{100}) << "upload " << i << " has a thread";
+    }
+    kept.write(looking);
+    EXPECT_EQ(kept.answers(1), std::vector<int>{200});
+    for (auto& upload : uploads) {
+        upload->write("ab");
+        EXPECT_EQ(upload->answers(1), std::vector<int>{201});
+    }
+}
+
 // More than the whole server can hold at a time.
 TEST_P(SilentStrangers, OfOneAddressGiveWayToOthersWhenTheyAreTooMany) {
     const StoreDirectory directory;

@@ -1,4 +1,5 @@
 #include "foundation/Date.h"
+#include "store/http/ConnectionRamp.h"
 #include "store/http/CurlDecisions.h"
 #include "store/http/CurlSlot.h"
 #include "store/http/HttpTransport.h"
@@ -88,6 +89,7 @@ struct CurlTransport::Impl {
     std::set<std::string> digestOrigins;
     std::set<std::string> http2Origins;
     KeptConnections kept;
+    ConnectionRamp ramp;
     SteadyTime notBefore{}; // Retry-After
     std::optional<SteadyTime> curlTimer;
     std::optional<SteadyTime> closing; // when nothing comes until then; none: no connection stands
@@ -99,7 +101,8 @@ struct CurlTransport::Impl {
 };
 
 CurlTransport::Impl::Impl(CurlTransportOptions o)
-    : options(std::move(o)), kept(options.secondsAsleep ? options.secondsAsleep : KeptConnections::secondsAsleep) {
+    : options(std::move(o)), kept(options.secondsAsleep ? options.secondsAsleep : KeptConnections::secondsAsleep),
+      ramp(options.fewAtFirst.value_or(ConnectionRamp::Pace()), options.maxConnections) {
     static const CURLcode global = curl_global_init(CURL_GLOBAL_ALL);
     (void)global;
     epoll = epoll_create1(EPOLL_CLOEXEC);
@@ -196,6 +199,7 @@ void CurlTransport::Impl::renewConnections() {
     for (const CurlSlot* slot : active) kept.foundDead(slot->job()->origin, now);
     if (!active.empty()) return;
     closing.reset();
+    ramp.closed();
     curl_multi_cleanup(multi);
     curlTimer.reset();
     makeMulti();
@@ -289,7 +293,8 @@ void CurlTransport::Impl::dropAborted() {
 }
 
 size_t CurlTransport::Impl::admissionLimit() const {
-    return static_cast<size_t>(http2Origins.empty() ? options.maxConnections : options.maxStreams);
+    if (!http2Origins.empty()) return static_cast<size_t>(options.maxStreams);
+    return static_cast<size_t>(options.fewAtFirst ? ramp.allowed() : options.maxConnections);
 }
 
 void CurlTransport::Impl::admit() {
@@ -341,6 +346,9 @@ void CurlTransport::Impl::detach(CurlSlot& slot) {
 
 void CurlTransport::Impl::finished(CurlSlot& slot, CURLcode code) {
     long opened = 0, version = 0;
+    curl_off_t left = 0, begun = 0; // microseconds since its start: the request could leave, the answer began
+    curl_easy_getinfo(slot.easy(), CURLINFO_PRETRANSFER_TIME_T, &left);
+    curl_easy_getinfo(slot.easy(), CURLINFO_STARTTRANSFER_TIME_T, &begun);
     curl_easy_getinfo(slot.easy(), CURLINFO_NUM_CONNECTS, &opened);
     curl_easy_getinfo(slot.easy(), CURLINFO_HTTP_VERSION, &version);
     connections += static_cast<uint64_t>(opened);
@@ -359,6 +367,7 @@ void CurlTransport::Impl::finished(CurlSlot& slot, CURLcode code) {
         return;
     }
     kept.heard(job->origin, job->response);
+    if (job->headerDone) ramp.answered(Steady::now(), microseconds(begun - left));
     if (version == CURL_HTTP_VERSION_2_0)
         http2Origins.insert(job->origin);
     else if (code == CURLE_OK && !job->http1Only && !http2Origins.empty())
@@ -423,6 +432,7 @@ void CurlTransport::Impl::checkDeadlines() {
         else if (slot->isIdle(now))
             late.emplace_back(slot, "Not a byte moved for " + std::to_string(limits.idleSeconds) + " s.");
     }
+    if (!pending.empty() && notBefore <= now) ramp.othersWait(now);
     nudge(now);
     for (auto& [slot, detail] : late) end(*slot, TransportError::timedOut, detail);
     // Whoever cannot be served before the deadline hears it now.

@@ -2,6 +2,7 @@
 
 #include "foundation/Date.h"
 #include "foundation/Url.h"
+#include "store/http/ConnectionRamp.h"
 
 #include <atomic>
 #include <cstdint>
@@ -107,6 +108,8 @@ struct CurlTransportOptions {
     int maxStreams = 100;             // on one HTTP/2 connection
     double maxRetryAfterSeconds = 60; // a longer Retry-After is taken as this
     bool http2 = true;                // offer it
+    // Not all connections at once, unless the store turns out to be far; none: as many as there are requests.
+    std::optional<ConnectionRamp::Pace> fewAtFirst;
     // Seconds that the machine has spent asleep since its start; none: as the kernel has it. For tests. On the
     // transport's thread.
     std::function<double()> secondsAsleep;

@@ -104,6 +104,7 @@ CurlTransportOptions transportOptions(const CXDAVAccount& account) {
     // about half as much again as ten plain connections do.
     for (const std::string& origin : account.origins())
         options.http2 = options.http2 && !isLoopbackHost(Url(origin + "/").host());
+    if (!options.http2) options.fewAtFirst.emplace();
     if (const char* wish = getenv("ROLVANE_HTTP2")) options.http2 = std::string_view(wish) == "always"; // measurements
     return options;
 }
