@@ -177,6 +177,8 @@ TEST(SlowUploads, CloseNobodysKeptConnection) {
     const StoreDirectory directory;
     PrivateStoreOptions options = optionsIn(directory);
     options.maximumProcesses = 1;
+    options.keepAliveSeconds = 600; // however slow the machine is
+    options.extraConfiguration = {"RequestReadTimeout body=600"};
     PrivateStore store(options);
     store.addUser("alice", "word");
     store.start();
