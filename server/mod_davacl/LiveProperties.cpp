@@ -209,6 +209,7 @@ dav_error* addToHeader(request_rec* r, const dav_resource*, apr_text_header* tex
         return true;
     });
     if (servesFiles(r)) apr_text_append(r->pool, text, kMembersTagClass);
+    if (servesFiles(r)) apr_text_append(r->pool, text, kSyncClass);
     return nullptr;
 }
 

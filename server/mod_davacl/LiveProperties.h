@@ -13,6 +13,8 @@ namespace rolvane::davacl {
 inline constexpr const char* kOwnNamespace = "http://rolvane.net/ns/";
 inline constexpr const char* kMembersTagName = "members-tag";
 inline constexpr const char* kMembersTagClass = "<http://rolvane.net/ns/members-tag>";
+// That collections can be synchronised, so that nobody has to ask each for its reports.
+inline constexpr const char* kSyncClass = "<http://rolvane.net/ns/sync-collection>";
 
 // The properties of RFC 3744 section 5 on everything below the base. They are no part of "allprop".
 extern const dav_liveprop_group kLiveProperties;

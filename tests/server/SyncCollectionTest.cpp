@@ -64,7 +64,9 @@ protected:
             }
             const bool isGone = response.find("<D:status>HTTP/1.1 404") != std::string::npos &&
                                 response.find("propstat") == std::string::npos;
-            if (!isGone) EXPECT_THAT(response, HasSubstr(href.ends_with('/') ? "<D:collection/>" : "getetag>")) << href;
+            if (!isGone) {
+                EXPECT_THAT(response, HasSubstr(href.ends_with('/') ? "<D:collection/>" : "getetag>")) << href;
+            }
             out.changes.push_back((isGone ? "-" : "+") + href.substr(4));
         }
         std::sort(out.changes.begin(), out.changes.end());

@@ -110,7 +110,7 @@ TEST(ExpectedAnswer, NoAnswerIsAFailureAndAnUnknownMethodHasNoSuccess) {
     lost.error = TransportError::timedOut;
     for (const char* method : kAll) EXPECT_EQ(verdictOn(method, lost), AnswerVerdict::failure);
     for (const int status : {200, 201, 204, 207})
-        EXPECT_EQ(verdictOn("REPORT", answerOf(status)), AnswerVerdict::foreign);
+        EXPECT_EQ(verdictOn("SEARCH", answerOf(status)), AnswerVerdict::foreign);
 }
 
 // A client on a real store, before which a portal stands while `closed`.

@@ -52,7 +52,7 @@ struct MultistatusReader::Impl : XmlSax {
     int propstatStatus = 0;
     bool rootSeen = false, hrefSeen = false;
     bool statusSeen = false; // of the propstat under way
-    std::string gathered;
+    std::string gathered, syncToken;
 
     bool opened(const std::vector<std::string>& path) override {
         gathered.clear();
@@ -78,6 +78,7 @@ struct MultistatusReader::Impl : XmlSax {
     bool closed(const std::vector<std::string>& path) override {
         const std::string content = trimmed(gathered);
         gathered.clear();
+        if (path.size() == 2 && path[1] == "sync-token") syncToken = content;
         if (path.size() < 2 || path[1] != "response") return true;
         if (path.size() == 2) return closedResponse();
         if (path.size() == 3) return closedInResponse(path[2], content);
@@ -113,6 +114,7 @@ struct MultistatusReader::Impl : XmlSax {
         if (name == "getcontentlength") offered.length = parsedNumber(content);
         if (name == "getetag") offered.etag = EntityTag(content);
         if (name == kMembersTag) offered.membersTag = content;
+        if (name == "sync-token") offered.syncToken = content;
     }
 
     void takeOffered() {
@@ -121,6 +123,7 @@ struct MultistatusReader::Impl : XmlSax {
         if (offered.length) entry.length = offered.length;
         if (!offered.etag.empty()) entry.etag = offered.etag;
         if (!offered.membersTag.empty()) entry.membersTag = offered.membersTag;
+        if (!offered.syncToken.empty()) entry.syncToken = offered.syncToken;
     }
 };
 
@@ -134,6 +137,10 @@ bool MultistatusReader::feed(std::string_view bytes) {
 std::optional<std::vector<MultistatusEntry>> MultistatusReader::finish() {
     if (!_impl->finish() || !_impl->rootSeen) return std::nullopt;
     return std::move(_impl->entries);
+}
+
+const std::string& MultistatusReader::syncToken() const {
+    return _impl->syncToken;
 }
 
 namespace {

@@ -21,6 +21,7 @@ struct MultistatusEntry {
     std::optional<uint64_t> length;
     EntityTag etag;
     std::string membersTag; // of a collection, on a store that gives one (StoreSession::givesMembersTags)
+    std::string syncToken = {}; // of a collection (RFC 6578 section 4), where it was asked for
 };
 
 struct MultistatusLimits {
@@ -39,6 +40,8 @@ public:
     bool feed(std::string_view bytes); // false once the body cannot be good any more; further calls do nothing
     // The entries in the server's order; nothing when the body is not one whole, well-formed multistatus.
     std::optional<std::vector<MultistatusEntry>> finish();
+    // After that: what the whole answer says (RFC 6578 section 6.2), "" when it says none.
+    const std::string& syncToken() const;
 
     struct Impl;
 

@@ -3,6 +3,7 @@
 #include "foundation/Log.h"
 #include "store/dav/Collections.h"
 #include "store/files/StoreFiles.h"
+#include "store/files/SyncedListing.h"
 
 #include <algorithm>
 #include <condition_variable>
@@ -36,14 +37,6 @@ std::string pathOf(const Url& name) {
     return name.path();
 }
 
-// The path of an href that is a URL of its own: behind a proxy servers write another scheme, host or port than the
-// client's. Where nothing is sent, the path alone counts.
-std::string pathIn(const std::string& href) {
-    const auto url = href.starts_with('/') ? std::nullopt : Url::parse(href);
-    const bool isPlain = url && href.find_first_of("?#") == std::string::npos;
-    return isPlain ? url->encodedPath() : href;
-}
-
 bool isBaseLocation(const Url& name) {
     return name.pathComponents().size() == 3;
 } // "/", user, "Contacts"
@@ -58,6 +51,7 @@ struct StoreListing::Asked {
     std::mutex mutex;
     std::condition_variable changed;
     std::deque<size_t> arrived; // guarded by the mutex
+    bool isOfChanges = false;   // one answer, to the question what has changed
 
     void arrive(size_t number, HttpResponse answer) {
         const std::lock_guard guard(mutex);
@@ -113,7 +107,7 @@ StoreListing::Members StoreListing::read(Asked& asked, size_t number) {
     std::vector<std::pair<Url, MultistatusEntry>> inside;
     bool isNamed = false, isCollection = false, whole = true;
     for (const MultistatusEntry& entry : *entries) {
-        const auto name = _session.nameFor(pathIn(entry.href));
+        const auto name = _session.nameFor(StoreSession::pathOfHref(entry.href));
         if (name && *name == container) {
             isNamed = true;
             isCollection = entry.isCollection;
@@ -189,18 +183,24 @@ bool StoreListing::addEntries(const Members& members, FileListing& out, std::vec
 }
 
 // A group that is a collection has the version of the state inside it; without one it has no date.
-bool StoreListing::addStates(const std::vector<Url>& groups, FileListing& out) {
+bool StoreListing::addStates(const std::vector<Url>& groups, bool synced, FileListing& out) {
     std::vector<HttpRequest> requests;
     for (const Url& group : groups)
         requests.push_back(
             StoreSession::propfind(_session.endpoint(group)->cxURLByAppendingComponent(CXDAVManager::kStateName), 0));
     const auto answers = _session.sendAll(std::move(requests), [](int status) { return status == 404; });
     for (size_t i = 0; i < answers.size(); ++i) {
-        if (answers[i].status == 404) continue;
+        if (answers[i].status == 404) {
+            if (synced) _listings.keep(groups[i], ListingMemory::kSynced, {});
+            continue;
+        }
         MultistatusReader reader;
         if (answers[i].status != 207 || !reader.feed(answers[i].body)) return false;
         const auto entries = reader.finish();
         if (!entries || entries->size() != 1) return false;
+        if (synced)
+            _listings.keep(groups[i], ListingMemory::kSynced,
+                           {{groups[i].cxURLByAppendingComponent(CXDAVManager::kStateName), entries->front()}});
         stamp(groups[i].absoluteString(), entries->front(), serverDateOf(answers[i]), out[pathOf(groups[i])]);
     }
     return true;
@@ -208,14 +208,16 @@ bool StoreListing::addStates(const std::vector<Url>& groups, FileListing& out) {
 
 // The tags are told before the buckets are listed: what changes in between is in the listing already, and listed again
 // the next time.
-bool StoreListing::addBuckets(const Members& people, bool tagged, FileListing& out,
+bool StoreListing::addBuckets(const Members& people, Keeping keeping, FileListing& out,
                               const CXFileManager::ListingPart& part) {
     if (!people.entries) return false;
     std::vector<Url> none, names;
     std::vector<std::string> tags;
     for (const auto& [name, entry] : *people.entries) {
         if (!entry.isCollection || StoreFiles::isReservedName(name.cxLastComponent())) continue;
-        const std::string tag = tagged ? entry.membersTag : std::string();
+        const std::string tag = keeping == Keeping::synced   ? ListingMemory::kSynced
+                                : keeping == Keeping::tagged ? entry.membersTag
+                                                             : std::string();
         if (addUnchanged(name, tag, people.serverDate, out)) continue;
         names.push_back(name);
         tags.push_back(tag);
@@ -256,23 +258,90 @@ bool StoreListing::addUnchanged(const Url& container, const std::string& tag, co
 }
 
 StoreListing::AskedRef StoreListing::begin(const Url& container) {
+    if (isBaseLocation(container) && _session.maySynchronize())
+        return _listings.token(container).empty() ? AskedRef() : askForChanges(container);
+    return askForAll(container, _session.mayGiveMembersTags());
+}
+
+StoreListing::AskedRef StoreListing::askForAll(const Url& container, bool tagged) {
     std::vector<Url> asked{container};
     const Url people = container.cxURLByAppendingComponent("People");
     if (isBaseLocation(container)) asked.push_back(people); // nearly always there, and a way to the store saved
-    return ask(asked, _session.mayGiveMembersTags() ? &people : nullptr);
+    return ask(asked, tagged ? &people : nullptr);
+}
+
+StoreListing::AskedRef StoreListing::askForChanges(const Url& tree) {
+    auto asked = std::make_shared<Asked>();
+    asked->isOfChanges = true;
+    asked->answers.resize(1);
+    _session.start(SyncedListing(_session, _listings).question(tree),
+                   [asked](HttpResponse answer) { asked->arrive(0, std::move(answer)); });
+    return asked;
+}
+
+// What the memory has of the tree once it is up to date.
+std::optional<FileListing> StoreListing::listChanged(const Url& tree, AskedRef begun) {
+    SyncedListing synced(_session, _listings);
+    if (!begun || !begun->isOfChanges) begun = askForChanges(tree);
+    HttpResponse answer = std::move(begun->answers[begun->next()]);
+    const auto serverDate = serverDateOf(answer);
+    answer = _session.judged(synced.question(tree), std::move(answer), [](int) { return true; });
+    if (!synced.bringUpToDate(tree, std::move(answer))) return std::nullopt;
+    const Url people = tree.cxURLByAppendingComponent("People");
+    Members top{207, _listings.entries(tree, ListingMemory::kSynced), serverDate};
+    FileListing out;
+    std::vector<Url> groups;
+    bool whole = addEntries(top, out, groups);
+    const auto found = out.find(pathOf(people));
+    if (whole && found != out.end() && found->second.isCollection) {
+        const auto buckets = _listings.entries(people, ListingMemory::kSynced);
+        whole = buckets.has_value();
+        if (whole)
+            for (const auto& [name, entry] : *buckets)
+                if (entry.isCollection && !StoreFiles::isReservedName(name.cxLastComponent()))
+                    whole = addUnchanged(name, ListingMemory::kSynced, serverDate, out) && whole;
+    }
+    for (const Url& group : groups) {
+        const bool known = _listings.forEach(group, ListingMemory::kSynced, [&](const ListingMemory::Member& state) {
+            if (!state.entry.isCollection && state.encodedName == CXDAVManager::kStateName)
+                stamp(group.absoluteString(), state.entry, serverDate, out[pathOf(group)]);
+        });
+        whole = whole && known;
+    }
+    if (whole) return out;
+    _listings.forgetBelow(tree);
+    return std::nullopt;
 }
 
 std::optional<FileListing> StoreListing::list(const Url& container, const AskedRef& begun,
                                               const CXFileManager::ListingPart& part) {
+    std::string token;
+    if (isBaseLocation(container) && _session.maySynchronize()) {
+        if (!_listings.token(container).empty())
+            if (auto out = listChanged(container, begun)) return out;
+        // What changes while the tree is listed is told again by this token.
+        token = SyncedListing(_session, _listings).tokenOf(container);
+        if (!token.empty()) _listings.forgetBelow(container);
+    }
+    const auto answers = readAll(begun && !begun->isOfChanges && token.empty()
+                                     ? *begun
+                                     : *askForAll(container, token.empty() && _session.mayGiveMembersTags()));
     FileListing out;
     std::vector<Url> groups;
     const Url people = container.cxURLByAppendingComponent("People");
-    const auto answers = readAll(begun ? *begun : *begin(container));
+    const bool synced = !token.empty();
     if (answers.empty() || !addEntries(answers.front(), out, groups)) return std::nullopt;
     const auto found = out.find(pathOf(people));
     const bool holdsPeople = answers.size() == 2 && found != out.end() && found->second.isCollection;
-    if (holdsPeople && !addBuckets(answers.back(), _session.givesMembersTags(), out, part)) return std::nullopt;
-    return addStates(groups, out) ? std::optional(std::move(out)) : std::nullopt;
+    const Keeping keeping = synced ? Keeping::synced : _session.givesMembersTags() ? Keeping::tagged : Keeping::nothing;
+    if (holdsPeople && !addBuckets(answers.back(), keeping, out, part)) return std::nullopt;
+    if (!addStates(groups, synced, out)) return std::nullopt;
+    if (synced) {
+        _listings.keep(container, ListingMemory::kSynced, *answers.front().entries);
+        if (holdsPeople) _listings.keep(people, ListingMemory::kSynced, *answers.back().entries);
+        _listings.keepToken(container, token);
+    }
+    return out;
 }
 
 } // namespace rolvane

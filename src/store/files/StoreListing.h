@@ -12,8 +12,9 @@
 
 namespace rolvane {
 
-// Lists containers of a store, one PROPFIND of depth 1 a collection, in parallel; of the buckets of a tree only those
-// whose tag says that they have changed since they were listed last. Complete or nothing. Any thread.
+// Lists containers of a store, one PROPFIND of depth 1 a collection, in parallel. Of a tree that was listed before it
+// asks for the changes alone (SyncedListing) where the store tells them, and else lists only the buckets whose tag says
+// that they have changed. Complete or nothing. Any thread.
 class StoreListing {
 public:
     StoreListing(StoreSession& session, VersionMemory& versions, ListingMemory& listings)
@@ -27,7 +28,7 @@ public:
     // Containers that the store was asked to list, with the answers as they come.
     struct Asked;
     using AskedRef = std::shared_ptr<Asked>;
-    // What `list` of the container asks first. Does not wait.
+    // What `list` of the container asks first. Does not wait. Null where a token has to be asked for before.
     AskedRef begin(const Url& container);
     // As CXFileManager::infoForFilesInContainer; `begun`: goes on from there; `part`: as of
     // infoForFilesInContainerByParts.
@@ -48,11 +49,15 @@ private:
     Members read(Asked& asked, size_t number); // of an answer that has come
     std::vector<Members> readAll(Asked& asked);
     bool isEmptyCollection(const Url& place);
-    bool addBuckets(const Members& people, bool tagged, FileListing& out, const CXFileManager::ListingPart& part);
+    enum class Keeping { nothing, tagged, synced };
+    AskedRef askForAll(const Url& container, bool tagged);
+    AskedRef askForChanges(const Url& tree);
+    std::optional<FileListing> listChanged(const Url& tree, AskedRef begun);
+    bool addBuckets(const Members& people, Keeping keeping, FileListing& out, const CXFileManager::ListingPart& part);
     bool addUnchanged(const Url& container, const std::string& tag, const std::optional<Date>& serverDate,
                       FileListing& out);
     bool addEntries(const Members& members, FileListing& out, std::vector<Url>& groupCollections);
-    bool addStates(const std::vector<Url>& groups, FileListing& out);
+    bool addStates(const std::vector<Url>& groups, bool synced, FileListing& out);
     void stamp(std::string_view name, const MultistatusEntry& entry, const std::optional<Date>& serverDate,
                FileInfo& info);
 

@@ -20,8 +20,9 @@ bool containsNoCase(std::string_view text, std::string_view wanted) {
 enum class Method { options, propfind, read, put, remove, mkcol, transfer, lock, unlock, acl, other };
 
 Method methodOf(std::string_view name) {
-    static constexpr std::array<std::pair<std::string_view, Method>, 12> kMethods{{{"OPTIONS", Method::options},
+    static constexpr std::array<std::pair<std::string_view, Method>, 13> kMethods{{{"OPTIONS", Method::options},
                                                                                    {"PROPFIND", Method::propfind},
+                                                                                   {"REPORT", Method::propfind},
                                                                                    {"GET", Method::read},
                                                                                    {"HEAD", Method::read},
                                                                                    {"PUT", Method::put},

@@ -33,6 +33,7 @@ TransportCredentials::Scheme schemeOf(Authentication a) {
     return TransportCredentials::Scheme::automatic;
 }
 
+constexpr std::string_view kSyncClass = "<http://rolvane.net/ns/sync-collection>";
 constexpr std::string_view kMembersTagClass = "<http://rolvane.net/ns/members-tag>";
 
 std::shared_ptr<const std::string> makePropfindBody(const char* more) {
@@ -132,6 +133,12 @@ HttpRequest StoreSession::request(std::string method, Url url) {
     r.method = std::move(method);
     r.url = std::move(url);
     return r;
+}
+
+std::string StoreSession::pathOfHref(const std::string& href) {
+    const auto url = href.starts_with('/') ? std::nullopt : Url::parse(href);
+    const bool isPlain = url && href.find_first_of("?#") == std::string::npos;
+    return isPlain ? url->encodedPath() : href;
 }
 
 HttpRequest StoreSession::propfind(Url url, int depth, bool withMembersTags) {
@@ -301,6 +308,7 @@ bool StoreSession::heedOptions(const HttpResponse& answer) {
     _davSeen = steadyMilliseconds();
     _accessLists = announcesDavClass(answer, "access-control") ? 1 : 0;
     _membersTags = announcesDavClass(answer, kMembersTagClass);
+    _syncs = announcesDavClass(answer, kSyncClass);
     _mayKeepLocks = announcesDavClass(answer, "2");
     heedNews(answer);
     return true;

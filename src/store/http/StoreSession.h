@@ -68,6 +68,9 @@ public:
     bool givesMembersTags() const { return _membersTags; }
     // The same, or it has not been asked yet.
     bool mayGiveMembersTags() const { return _membersTags || _accessLists < 0; }
+    // Whether collections may be worth the question what has changed in them (RFC 6578), as the server last said.
+    bool maySynchronize() const { return _syncs; }
+    void doesNotSynchronize() { _syncs = false; } // until it says so again
     // Where the store tells news of trees to whoever waits, as it last said; nothing when it does not.
     struct NewsOffer {
         Url place;                 // on the account's own origin
@@ -81,6 +84,9 @@ public:
     std::optional<std::string> password();
 
     static HttpRequest request(std::string method, Url url);
+    // The path of an href that is a URL of its own: behind a proxy servers write another scheme, host or port than the
+    // client's. Where nothing is sent, the path alone counts.
+    static std::string pathOfHref(const std::string& href);
     static HttpRequest propfind(Url url, int depth, bool withMembersTags = false);
 
 private:
@@ -112,6 +118,7 @@ private:
     bool _loginProven = false; // a request that needs a login has succeeded
     std::atomic<bool> _signedIn{false};
     std::atomic<bool> _membersTags{false};
+    std::atomic<bool> _syncs{false};
     std::atomic<bool> _mayKeepLocks{true};
     std::atomic<int> _accessLists{-1};   // 1 or 0 as the server announced it last, -1: it never answered
     std::atomic<int64_t> _hangsUntil{0}; // steady milliseconds: OPTIONS of the tree were not answered, those above were

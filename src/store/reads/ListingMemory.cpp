@@ -40,6 +40,7 @@ void ListingMemory::keep(const Url& container, const std::string& tag, const Ent
     if (tag.empty() || fresh.bytes() > kMostBytes) return;
     if (_bytes + fresh.bytes() > kMostBytes) {
         _containers.clear();
+        _tokens.clear();
         _bytes = 0;
     }
     _bytes += fresh.bytes();
@@ -49,7 +50,46 @@ void ListingMemory::keep(const Url& container, const std::string& tag, const Ent
 void ListingMemory::forgetAll() {
     const std::lock_guard guard(_mutex);
     _containers.clear();
+    _tokens.clear();
     _bytes = 0;
+}
+
+void ListingMemory::forgetBelow(const Url& container) {
+    const std::string& place = container.absoluteString();
+    const std::lock_guard guard(_mutex);
+    _tokens.erase(place);
+    std::erase_if(_containers, [&](const auto& each) {
+        const bool goes =
+            each.first.starts_with(place) && (each.first.size() == place.size() || each.first[place.size()] == '/');
+        if (goes) _bytes -= each.second.bytes();
+        return goes;
+    });
+}
+
+void ListingMemory::keepToken(const Url& tree, const std::string& token) {
+    const std::lock_guard guard(_mutex);
+    _tokens[tree.absoluteString()] = token;
+}
+
+std::string ListingMemory::token(const Url& tree) const {
+    const std::lock_guard guard(_mutex);
+    const auto found = _tokens.find(tree.absoluteString());
+    return found == _tokens.end() ? std::string() : found->second;
+}
+
+bool ListingMemory::has(const Url& container, const std::string& tag) const {
+    const std::lock_guard guard(_mutex);
+    const auto found = _containers.find(container.absoluteString());
+    return found != _containers.end() && found->second.tag == tag;
+}
+
+std::optional<ListingMemory::Entries> ListingMemory::entries(const Url& container, const std::string& tag) const {
+    Entries out;
+    const bool isKept = forEach(container, tag, [&](const Member& member) {
+        out.emplace_back(container.cxURLByAppendingComponent(Url::percentDecode(std::string(member.encodedName))),
+                         member.entry);
+    });
+    return isKept ? std::optional(std::move(out)) : std::nullopt;
 }
 
 } // namespace rolvane

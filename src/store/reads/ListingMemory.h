@@ -27,6 +27,16 @@ public:
     void keep(const Url& container, const std::string& tag, const Entries& entries);
 
     void forgetAll();
+    void forgetBelow(const Url& container); // the container, whatever lies below it, and its token
+
+    // Up to where the containers of a tree are known (RFC 6578): those that are kept with the tag kSynced are as the
+    // token says. Goes with anything of the memory.
+    static constexpr const char* kSynced = "synced";
+    void keepToken(const Url& tree, const std::string& token);
+    std::string token(const Url& tree) const; // "" when there is none
+    bool has(const Url& container, const std::string& tag) const;
+    // The members, named below the container; nothing when it is not kept with this tag.
+    std::optional<Entries> entries(const Url& container, const std::string& tag) const;
 
     struct Member {
         std::string_view encodedName; // the last component of the URL, as written
@@ -60,6 +70,7 @@ private:
 
     mutable std::mutex _mutex; // guards the following
     std::unordered_map<std::string, Container> _containers;
+    std::unordered_map<std::string, std::string> _tokens; // by tree
     size_t _bytes = 0;
 };
 

@@ -1,0 +1,158 @@
+#include "store/files/SyncedListing.h"
+
+#include "foundation/Log.h"
+#include "store/dav/CXDAVManager.h"
+
+#include <algorithm>
+#include <map>
+#include <memory>
+#include <utility>
+
+namespace rolvane {
+namespace {
+
+constexpr size_t kAnswerBytes = 64u << 20;
+constexpr int kMostPages = 10000;
+constexpr int kInsufficientStorage = 507;
+
+bool isAny(int) {
+    return true;
+}
+
+std::string quoted(const std::string& text) {
+    std::string out;
+    for (const char c : text) {
+        if (c == '<')
+            out += "&lt;";
+        else if (c == '&')
+            out += "&amp;";
+        else
+            out += c;
+    }
+    return out;
+}
+
+// What the listing of a tree needs: the tree, "People" and the buckets, and each group's state.
+bool isListed(const std::vector<std::string>& below) {
+    const bool inPeople = below.front() == "People";
+    return below.size() == 1 || (inPeople && below.size() <= 3) ||
+           (below.size() == 2 && below.front().ends_with("CXGroup") && below.back() == CXDAVManager::kStateName);
+}
+
+bool holdsListed(const std::vector<std::string>& below) {
+    return below.size() == 1 ? below.front() == "People" || below.front().ends_with("CXGroup")
+                             : below.size() == 2 && below.front() == "People";
+}
+
+std::vector<std::string> segmentsBelow(const Url& tree, const Url& name) {
+    const auto whole = name.pathComponents(), above = tree.pathComponents();
+    if (whole.size() <= above.size() || !std::equal(above.begin(), above.end(), whole.begin())) return {};
+    return {whole.begin() + static_cast<std::ptrdiff_t>(above.size()), whole.end()};
+}
+
+struct Edits {
+    std::map<std::string, std::optional<MultistatusEntry>> members; // by the name's text; nothing: departed
+    Url container;
+};
+
+} // namespace
+
+std::string SyncedListing::tokenOf(const Url& tree) {
+    const auto place = _session.collectionEndpoint(tree);
+    if (!place) return {};
+    HttpRequest r = StoreSession::propfind(*place, 0);
+    r.body = std::make_shared<const std::string>("<?xml version=\"1.0\" encoding=\"utf-8\"?>\n<propfind "
+                                                 "xmlns=\"DAV:\"><prop><sync-token/></prop></propfind>");
+    const HttpResponse answer = _session.send(std::move(r), isAny);
+    MultistatusReader reader;
+    if (!answer.complete() || answer.status != 207 || !reader.feed(answer.body)) return {};
+    const auto entries = reader.finish();
+    return entries && entries->size() == 1 ? entries->front().syncToken : std::string();
+}
+
+HttpRequest SyncedListing::question(const Url& tree) const {
+    HttpRequest r = StoreSession::request("REPORT", *_session.collectionEndpoint(tree));
+    r.headers = {{"Depth", "0"}, {"Content-Type", "application/xml; charset=utf-8"}};
+    r.body = std::make_shared<const std::string>(
+        "<?xml version=\"1.0\" encoding=\"utf-8\"?>\n<sync-collection xmlns=\"DAV:\"><sync-token>" +
+        quoted(_memory.token(tree)) +
+        "</sync-token><sync-level>infinite</sync-level><prop><resourcetype/><getlastmodified/><getcontentlength/>"
+        "<getetag/></prop></sync-collection>");
+    r.limits = {300, 60, kAnswerBytes, 64u << 10};
+    return r;
+}
+
+bool SyncedListing::bringUpToDate(const Url& tree, HttpResponse first) {
+    HttpResponse answer = std::move(first);
+    for (int page = 0; page < kMostPages; ++page) {
+        bool isCut = false;
+        if (!take(tree, answer, isCut)) break;
+        if (!isCut) return true;
+        answer = _session.send(question(tree), isAny);
+    }
+    _memory.forgetBelow(tree);
+    return false;
+}
+
+bool SyncedListing::take(const Url& tree, const HttpResponse& answer, bool& isCut) {
+    if (!answer.complete()) return false;
+    if (answer.status == 400 || answer.status == 405 || answer.status == 501) _session.doesNotSynchronize();
+    MultistatusReader reader;
+    if (answer.status != 207 || !reader.feed(answer.body)) return false;
+    const auto changes = reader.finish();
+    if (!changes || reader.syncToken().empty() || !apply(tree, *changes, isCut)) return false;
+    if (isCut && reader.syncToken() == _memory.token(tree)) return false; // it would never end
+    _memory.keepToken(tree, reader.syncToken());
+    return true;
+}
+
+// An answer tells of a member before or after the collection that it has come in.
+bool SyncedListing::apply(const Url& tree, const std::vector<MultistatusEntry>& changes, bool& isCut) {
+    std::map<std::string, Edits> edits; // by container
+    std::vector<Url> departed, collections;
+    for (const MultistatusEntry& change : changes) {
+        const auto name = _session.nameFor(StoreSession::pathOfHref(change.href));
+        if (name && *name == tree) {
+            isCut = isCut || change.status == kInsufficientStorage;
+            if (change.status == 0 || change.status == 200 || change.status == kInsufficientStorage) continue;
+            return false;
+        }
+        const auto below = name ? segmentsBelow(tree, *name) : std::vector<std::string>();
+        if (below.empty()) {
+            CXLog("A change with a strange name in %@ cannot be heeded.", tree);
+            return false;
+        }
+        const bool isGone = change.status == 404;
+        if (!isGone && change.status != 0 && change.status != 200) return false;
+        if (isGone || !change.isCollection) departed.push_back(*name);
+        if (!isGone && change.isCollection && holdsListed(below)) collections.push_back(*name);
+        if (!isListed(below)) continue;
+        const Url container = name->cxURLByDeletingLastComponent();
+        Edits& inside = edits.try_emplace(container.absoluteString(), Edits{{}, container}).first->second;
+        inside.members[name->absoluteString()] = isGone ? std::nullopt : std::optional(change);
+    }
+    for (const Url& name : departed)
+        if (holdsListed(segmentsBelow(tree, name))) _memory.forgetBelow(name);
+    for (const Url& name : collections)
+        if (!_memory.has(name, ListingMemory::kSynced)) _memory.keep(name, ListingMemory::kSynced, {});
+    for (auto& [place, edit] : edits) {
+        // One that is not known has departed, or is told on a later page than what is in it.
+        const auto known = _memory.entries(edit.container, ListingMemory::kSynced);
+        const auto isThere = [](const auto& member) { return member.second.has_value(); };
+        if (!known && std::none_of(edit.members.begin(), edit.members.end(), isThere)) continue;
+        ListingMemory::Entries fresh;
+        for (const auto& [name, entry] : known.value_or(ListingMemory::Entries())) {
+            const auto found = edit.members.find(name.absoluteString());
+            if (found == edit.members.end())
+                fresh.emplace_back(name, entry);
+            else if (found->second)
+                fresh.emplace_back(name, *std::exchange(found->second, std::nullopt));
+        }
+        for (const auto& [name, entry] : edit.members)
+            if (entry) fresh.emplace_back(*Url::parse(name), *entry);
+        _memory.keep(edit.container, ListingMemory::kSynced, fresh);
+    }
+    return _memory.has(tree, ListingMemory::kSynced);
+}
+
+} // namespace rolvane
