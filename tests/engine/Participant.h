@@ -163,7 +163,7 @@ public:
         size_t count = 0;
         for (const auto& exchange : wire->exchanges())
             count += exchange.method != "PROPFIND" && exchange.method != "GET" && exchange.method != "OPTIONS" &&
-                     exchange.method != "HEAD" && !exchange.path.ends_with("/dateFile");
+                     exchange.method != "HEAD" && exchange.method != "REPORT" && !exchange.path.ends_with("/dateFile");
         return count;
     }
     size_t reads(std::string_view below) const { // GET requests

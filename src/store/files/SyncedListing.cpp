@@ -118,9 +118,9 @@ bool SyncedListing::apply(const Url& tree, const std::vector<MultistatusEntry>& 
             return false;
         }
         const auto below = name ? segmentsBelow(tree, *name) : std::vector<std::string>();
-        if (below.empty()) {
-            CXLog("A change with a strange name in %@ cannot be heeded.", tree);
-            return false;
+        if (below.empty()) { // as in a listing
+            CXLog("An entry with a strange name in the listing of %@ is left out.", tree);
+            continue;
         }
         const bool isGone = change.status == 404;
         if (!isGone && change.status != 0 && change.status != 200) return false;
