@@ -20,7 +20,7 @@ struct MultistatusEntry {
     std::optional<Date> lastModified; // of RFC 9110 section 5.6.7, or RFC 3339
     std::optional<uint64_t> length;
     EntityTag etag;
-    std::string membersTag; // of a collection, on a store that gives one (StoreSession::givesMembersTags)
+    std::string membersTag;     // of a collection, on a store that gives one (StoreSession::givesMembersTags)
     std::string syncToken = {}; // of a collection (RFC 6578 section 4), where it was asked for
 };
 
