@@ -74,7 +74,7 @@ private:
 
 bool changes(const std::string& request) {
     return !request.starts_with("GET") && !request.starts_with("PROPFIND") && !request.starts_with("OPTIONS") &&
-           !request.starts_with("REPORT") && !request.starts_with("HEAD") && !request.starts_with("REPORT");
+           !request.starts_with("HEAD") && !request.starts_with("REPORT");
 }
 
 // False when the pass has fewer requests.
