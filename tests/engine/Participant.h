@@ -12,6 +12,7 @@
 #include "store/account/CXNetworkController.h"
 
 #include <filesystem>
+#include <functional>
 #include <map>
 #include <set>
 
@@ -61,8 +62,11 @@ struct ClockAhead : Clock {
 struct NoProgress : ProgressReporter {
     void startedPhase(int32_t) override {}
     void willProcessChangeRecord(const CXDChangeRecordPtr&) override {}
-    void didProcessChangeRecord(const CXDChangeRecordPtr&) override {}
+    void didProcessChangeRecord(const CXDChangeRecordPtr& record) override {
+        if (processed) processed(record);
+    }
     void stop() override {}
+    std::function<void(const CXDChangeRecordPtr&)> processed;
 };
 
 // One user of a store with everything that a daemon has: database, preferences, engine and both conduits. The contact

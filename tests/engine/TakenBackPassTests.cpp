@@ -153,6 +153,38 @@ TEST_F(TakenBackPass, ANameThatSomebodyElseGivesBehindItStays) {
     EXPECT_EQ(friends->name(), "Bob's") << log.text();
 }
 
+// Nobody has taken the name back that the pass wrote, which Bob has seen.
+TEST_F(TakenBackPass, ANameThatSomebodyElseGivesInThePlaceOfItsOwnStays) {
+    rename(alice, friends, "Renamed");
+    passThatIsTakenBack(alice);
+    bob.pass();
+    const CXRecordRef copy = copyOf(friends, kCXSubscribedGroupTable);
+    ASSERT_EQ(copy->valueForProperty(kCXGroupNameProperty), Value("Renamed"));
+    rename(bob, copy, "Bob's");
+    bob.pass();
+    settle();
+    EXPECT_EQ(friends->name(), "Bob's") << log.text();
+}
+
+TEST_F(TakenBackPass, ANewGroupKeepsTheNameThatItIsGivenDuringTheNextPass) {
+    const CXGroupRef crew = alice.group("Crew", {people[1]});
+    passThatIsTakenBack(alice);
+    bool renamed = false;
+    alice.wire->intercept([&](const HttpRequest& request) -> std::optional<HttpResponse> {
+        const bool isTheGroup =
+            request.url.encodedPath().find(std::string(cxUUIDPart(crew->uniqueId()))) != std::string::npos;
+        if (request.method == "PUT" && isTheGroup && !std::exchange(renamed, true)) rename(alice, crew, "Band");
+        return std::nullopt;
+    });
+    alice.pass();
+    alice.wire->intercept({});
+    ASSERT_TRUE(renamed) << log.text();
+    EXPECT_EQ(crew->name(), "Band") << log.text();
+    alice.database->deliverExternalChanges();
+    settle();
+    EXPECT_EQ(crew->name(), "Band") << log.text();
+}
+
 // Its absence in a database with another subscription is nobody's doing.
 TEST_F(TakenBackPass, WhatANewSubscriptionHasNotBroughtYetIsNotDeleted) {
     const CXPersonRef dora = addToAlices("Dora");

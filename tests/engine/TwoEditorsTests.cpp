@@ -197,6 +197,54 @@ TEST_F(TwoEditors, AContactThatIsDeletedBeforeItIsMergedDoesNotBecomeThePersonsO
     EXPECT_EQ(copies(), alice.view()) << log.text();
 }
 
+class RenamedDuringThePass : public TwoEditors {
+protected:
+    CXGroupRef copy() {
+        return std::dynamic_pointer_cast<CXGroup>(
+            bob.application->recordForUniqueId(cxUIDWithTableName(friends->uniqueId(), kCXSubscribedGroupTable)));
+    }
+    static void rename(Participant& user, const CXGroupRef& group, const char* name) {
+        group->setValue(Value(name), kCXGroupNameProperty);
+        user.application->save();
+    }
+    void expectName(const char* name) {
+        EXPECT_EQ(copy()->name(), name) << log.text();
+        bob.database->deliverExternalChanges();
+        settle();
+        EXPECT_EQ(copy()->name(), name) << log.text();
+        EXPECT_EQ(friends->name(), name) << log.text();
+        expectEqualAndQuiet();
+    }
+};
+
+TEST_F(RenamedDuringThePass, AGroupKeepsTheNameThatItWasGivenBeforeAnotherOneArrived) {
+    rename(alice, friends, "Owner's");
+    edit(alice, kCXNicknameProperty, "Countess");
+    alice.pass();
+    std::atomic<bool> renamed = false;
+    bob.wire->intercept([&](const HttpRequest& request) -> std::optional<HttpResponse> {
+        const bool reads =
+            request.url.encodedPath().find(std::string(cxUUIDPart(people[0]->uniqueId()))) != std::string::npos;
+        if (request.method == "GET" && reads && !renamed.exchange(true)) rename(bob, copy(), "Writer's");
+        return std::nullopt;
+    });
+    bob.pass();
+    ASSERT_TRUE(renamed);
+    expectName("Writer's");
+}
+
+TEST_F(RenamedDuringThePass, AGroupKeepsTheNameThatItWasGivenBeforeThePassWasSaved) {
+    rename(alice, friends, "Owner's");
+    alice.pass();
+    bool renamed = false;
+    bob.progress.processed = [&](const CXDChangeRecordPtr& record) {
+        if (record->type() == CXDChangeGroupName && !std::exchange(renamed, true)) rename(bob, copy(), "Writer's");
+    };
+    bob.pass();
+    ASSERT_TRUE(renamed);
+    expectName("Writer's");
+}
+
 // -- thousands of rounds, of which the suite makes a few
 
 namespace {

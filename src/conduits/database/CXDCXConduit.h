@@ -147,6 +147,7 @@ private:
     bool mayChange(const CXDChangeRecord& record, const CXRecord& found);
     // Has somebody else saved the record since this pass gathered its changes? That edit is still to be captured.
     bool hasUncapturedEdit(const UniqueId& uid);
+    bool isRenamedHere(const CXDChangeRecord& record, const CXGroup& group);
     void captureInserted(ChangeCapture& capture, const Array& identifiers);
     void captureReplaced(ChangeCapture& capture, const Array& inserted);
     void captureUpdated(ChangeCapture& capture, const Array& identifiers);

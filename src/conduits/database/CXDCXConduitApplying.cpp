@@ -224,7 +224,8 @@ bool CXDCXConduit::createStructureForGroup(const CXDChangeRecordPtr& record) {
     const Dictionary content = contentOf(*record);
     const CXGroupRef group = CXGroup::initWithUniqueId(uid);
     if (cxIsSubscribed(uid)) group->setValue(content[kCXRemoteLocationProperty], kCXRemoteLocationProperty);
-    if (!group->setValue(content[kCXGroupNameProperty], kCXGroupNameProperty) && there)
+    const bool isRenamed = there && isRenamedHere(*record, *there);
+    if ((isRenamed || !group->setValue(content[kCXGroupNameProperty], kCXGroupNameProperty)) && there)
         group->setValue(Value(there->name()), kCXGroupNameProperty);
     rolvane().addRecord(group);
     engine().saveInThePass();
@@ -233,8 +234,22 @@ bool CXDCXConduit::createStructureForGroup(const CXDChangeRecordPtr& record) {
 
 bool CXDCXConduit::changeGroupName(const CXDChangeRecordPtr& record) {
     if (namesAllGroup(*record)) return true;
-    if (const CXGroupRef group = groupOf(*record)) group->setValue(record->payload(), kCXGroupNameProperty);
+    const CXGroupRef group = groupOf(*record);
+    if (!group || isRenamedHere(*record, *group)) return true;
+    // As a replacement: a name that another program gives until the pass is saved stays.
+    Dictionary content = group->dictionaryRepresentation().mutableCopy();
+    content.set(kCXGroupNameProperty, record->payload());
+    group->resetWithDictionary(content, false, false);
     return true;
+}
+
+// A name that was given here since the pass has looked is an edit that was not sent yet, and goes out with the next
+// one.
+bool CXDCXConduit::isRenamedHere(const CXDChangeRecord& record, const CXGroup& group) {
+    const Dictionary groups = priorState()[record.user().value_or(kSelf).str()].dictionary();
+    const Value& known = groups[cxUIDWithTableName(group.sharingUniqueId(), kCXGroupTable).str()];
+    const Value& name = known.dictionary()[kCXGroupNameProperty];
+    return name && name != Value(group.name()) && hasUncapturedEdit(group.uniqueId());
 }
 
 bool CXDCXConduit::deleteGroup(const CXDChangeRecordPtr& record) {

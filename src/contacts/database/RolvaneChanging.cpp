@@ -102,8 +102,10 @@ void CXRolvane::Impl::replaceProperties(const UniqueId& uid, Dictionary fresh) {
 }
 
 void CXRolvane::Impl::insert(const UniqueId& uid, RecordKind is, const Dictionary& fresh) {
-    PendingRecord& p = work.insert(uid, is, storedRow(uid).has_value(), clock.now());
+    const auto row = storedRow(uid);
+    PendingRecord& p = work.insert(uid, is, row.has_value(), clock.now());
     work.replace(p, fresh);
+    if (row && !p.isInsertion()) p.replacedRow = row->properties;
     p.location = locationOf(is, fresh);
 }
 

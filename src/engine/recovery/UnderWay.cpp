@@ -117,21 +117,42 @@ public:
             left.set(kNames, touched[kNames]);
             return left;
         }
-        // A name that the pass did not write comes from somebody else.
         const auto name = _namesThere.find(uid.str());
-        if (name == _namesThere.end() || name->second == Value(there->name()) ||
-            !touched[kNames].array().contains(name->second))
+        const Value here(there->name());
+        if (name == _namesThere.end() || name->second == here) return left;
+        const Array written = touched[kNames].array();
+        // A name that the pass did not write comes from somebody else, who has seen the one that it wrote.
+        if (!written.contains(name->second)) {
+            if (written.contains(here)) _renamedThere.insert(uid.str());
             return left;
+        }
         _renamed.insert(uid.str());
-        add(CXDChangeGroupName, std::nullopt, uid, Value(there->name()));
+        add(CXDChangeGroupName, std::nullopt, uid, here);
         return left;
     }
 
     CXDChangeRecords take() { return std::move(_records); }
 
-    // Would it bring back, or take away, from the store what the database decides?
+    // The same of a composite, which says more than the name.
+    void overruleNameIn(CXDChangeRecordPtr& record) const {
+        if (record->type() != CXDCompositeGroupChange || !isWrite(*record) || record->user() != _tree.user ||
+            !record->group() || !_renamedThere.contains(shared(*record->group(), kCXGroupTable)))
+            return;
+        const Value content = record->inMemoryPayload();
+        if (!content.isDictionary() || !content.dictionary().contains(kCXGroupNameProperty)) return;
+        Dictionary without = content.dictionary().mutableCopy();
+        without.remove(kCXGroupNameProperty);
+        record = std::make_shared<CXDChangeRecord>(*record);
+        record->setPayload(without);
+    }
+
+    // Would it bring back, or take away, from the store what the database decides? Or name a group once more that
+    // somebody else has given another name since?
     bool isOverruled(const CXDChangeRecord& record) const {
-        if (record.initialSource() != CXDSyncSourceVaultra || record.user() != _tree.user) return false;
+        if (record.user() != _tree.user) return false;
+        if (isWrite(record) && record.type() == CXDChangeGroupName && record.group())
+            return _renamedThere.contains(shared(*record.group(), kCXGroupTable));
+        if (record.initialSource() != CXDSyncSourceVaultra) return false;
         const bool isSubgroup = record.type() == CXDAddGroupToGroup || record.type() == CXDRemoveGroupFromGroup;
         const std::string person =
             record.person() ? shared(*record.person(), isSubgroup ? kCXGroupTable : kCXPersonTable) : std::string();
@@ -188,7 +209,7 @@ private:
     const Dictionary _known; // by group
     CXRolvane& _rolvane;
     Holdings _holdings;
-    std::unordered_set<std::string> _gathered, _gone, _renamed;
+    std::unordered_set<std::string> _gathered, _gone, _renamed, _renamedThere;
     std::unordered_set<UniqueId> _withdrawn;
     std::unordered_map<std::string, Value> _namesThere; // that the store has and that are not known, by group
     // By group: the changes of members and subgroups that the pass was to make.
@@ -316,6 +337,7 @@ Dictionary settleUnderWay(const Dictionary& underWay, const SharedTree& tree, CX
     if (!left.empty() && of.contains(kSubscription))
         left.dictionaryFor(tree.user.str()).set(kSubscription, of[kSubscription]);
     std::erase_if(records, [&](const CXDChangeRecordPtr& record) { return settlement.isOverruled(*record); });
+    for (CXDChangeRecordPtr& record : records) settlement.overruleNameIn(record);
     for (CXDChangeRecordPtr& record : settlement.take()) records.push_back(std::move(record));
     return left;
 }
