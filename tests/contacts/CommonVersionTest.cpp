@@ -62,6 +62,29 @@ TEST_F(CommonVersion, IsWhatWasSentWhereTheContactWasEditedAgainMeanwhile) {
     EXPECT_EQ(d->editedSinceCommon(), std::vector{ada});
 }
 
+TEST_F(CommonVersion, KnowsWhatWasSentUntilOneIsSet) {
+    edit(*d.database, kCXNoteProperty, "one");
+    const auto one = d->personRow(ada)->encoded;
+    EXPECT_TRUE(d->commonVersion(ada)->sent.empty());
+    d->setSentVersion(ada, one);
+    d->save();
+    d->setSentVersion(ada, one);
+    d->save();
+    edit(*d.database, kCXNoteProperty, "two");
+    const auto two = d->personRow(ada)->encoded;
+    d->setSentVersion(ada, two);
+    d->save();
+    const auto version = d.open("another")->commonVersion(ada);
+    ASSERT_TRUE(version);
+    ASSERT_EQ(version->sent.size(), 2u) << "each once";
+    EXPECT_EQ(*version->sent[0], *one);
+    EXPECT_EQ(*version->sent[1], *two);
+    d->setCommonVersion(ada, one);
+    d->save();
+    EXPECT_TRUE(d->commonVersion(ada)->properties) << "of the second edit";
+    EXPECT_TRUE(d->commonVersion(ada)->sent.empty());
+}
+
 TEST_F(CommonVersion, GoesWithItsContactAndIsOfNoOtherOne) {
     d.addPerson("Ben", "B:CXPerson");
     d->save();

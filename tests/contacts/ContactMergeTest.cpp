@@ -276,6 +276,34 @@ RC_GTEST_PROP(ContactMerge, NothingThatEitherSideSaysIsLostUnlessItIsAConflict, 
         }
 }
 
+// A version that was sent and came, or did not come.
+RC_GTEST_PROP(ContactMerge, OwnVersionsThatMayHaveComeAreNobodyElsesChanges, ()) {
+    const Dictionary base = (*anyFacts()).contact(), sent = (*anyFacts()).contact(), ours = (*anyFacts()).contact();
+    const CXSide later = *rc::gen::element(CXSide::ours, CXSide::theirs);
+    RC_ASSERT(content(cxBaseAfterSending(base, sent, sent)) == content(sent));
+    RC_ASSERT(content(cxBaseAfterSending(base, sent, base)) == content(base));
+    for (const Dictionary& theirs : {sent, base}) {
+        const auto result = mergedContact(cxBaseAfterSending(base, sent, theirs), ours, theirs, later);
+        RC_ASSERT(content(result.contact) == content(ours));
+        RC_ASSERT(result.conflicts.empty());
+    }
+}
+
+// Somebody else has changed a version that came: that is a change, and our removal of what came is one, too.
+TEST(ContactMerge, OfAVersionThatCameTheOthersChangesAreTold) {
+    Facts base, sent, ours, theirs;
+    base.phone = {{"a", {"home", "1"}}, {"b", {"home", "2"}}};
+    sent.phone = {{"a", {"home", "11"}}, {"b", {"home", "2"}}, {"c", {"home", "3"}}};
+    theirs.phone = {{"a", {"home", "11"}}, {"b", {"home", "22"}}, {"c", {"home", "3"}}};
+    ours.phone = {{"b", {"home", "2"}}};
+    Facts all;
+    all.phone = {{"b", {"home", "22"}}};
+    const Dictionary common = cxBaseAfterSending(base.contact(), sent.contact(), theirs.contact());
+    const auto result = mergedContact(common, ours.contact(), theirs.contact(), CXSide::theirs);
+    EXPECT_EQ(content(result.contact), content(all.contact()));
+    EXPECT_TRUE(result.conflicts.empty());
+}
+
 // Without a base the result holds what the merging of two cards holds.
 RC_GTEST_PROP(ContactMerge, WithoutABaseNoValueIsLost, ()) {
     const Dictionary ours = (*anyFacts()).contact(), theirs = (*anyFacts()).contact();

@@ -134,6 +134,33 @@ TEST_F(TakenBackPass, ANumberThatIsReplacedBehindItDoesNotStandBesideItsSuccesso
     EXPECT_EQ(after->valueAtIndex(0), Value("22"));
 }
 
+// What the pass has written is the person's own, and no change of somebody else's.
+TEST_F(TakenBackPass, AnEditThatIsTakenBackBehindItIsTakenFromTheStore) {
+    const auto set = [&](const char* phone, const char* nickname) {
+        CXMutableMultiValue phones;
+        if (*phone) phones.addValue(Value(phone), "home", "P");
+        people[0]->setValue(phones, kCXPhoneProperty);
+        people[0]->setValue(Value(nickname), kCXNicknameProperty);
+        alice.application->save();
+    };
+    set("11", "Countess");
+    settle();
+    set("22", "Duchess");
+    passThatIsTakenBack(alice);
+    ASSERT_EQ(contentOf(fileOf(people[0]))[kCXNicknameProperty], Value("Duchess"));
+    bob.pass();
+    bob.copyOf(people[0])->setValue(Value("Engine"), kCXOrganizationProperty);
+    bob.application->save();
+    bob.pass();
+    set("", "Queen");
+    settle();
+    EXPECT_FALSE(people[0]->multiValueForProperty(kCXPhoneProperty)->count()) << log.text();
+    EXPECT_EQ(people[0]->valueForProperty(kCXNicknameProperty), Value("Queen"));
+    EXPECT_EQ(people[0]->valueForProperty(kCXOrganizationProperty), Value("Engine"));
+    EXPECT_EQ(contentOf(fileOf(people[0]))[kCXNicknameProperty], Value("Queen"));
+    EXPECT_TRUE(alice.database->conflicts().empty() && bob.database->conflicts().empty());
+}
+
 TEST_F(TakenBackPass, ANameThatTheOwnerTakesBackIsTakenFromTheStore) {
     rename(alice, friends, "Renamed");
     passThatIsTakenBack(alice);

@@ -188,11 +188,10 @@ void CXDCXConduit::takeIn(const CXDChangeRecord& record, CXPerson& person, const
         return;
     }
     const Dictionary ours = person.dictionaryRepresentation();
-    std::optional<Dictionary> base;
-    if (common) base = cxAsSent(BinaryValue::decode(*common->properties).dictionary());
     person.resetWithDictionary(content, true, false); // what is not known goes
     const auto theirs = person.encodedRepresentation();
     const Dictionary there = BinaryValue::decode(*theirs).dictionary(), here = cxAsSent(ours);
+    const std::optional<Dictionary> base = cxCommonBase(common, here, there);
     CXMergeResult merge = mergedContact(base, here, there, CXSide::ours);
     if (!merge.conflicts.empty()) {
         CXDConduit* source = engine().conduitForSyncSource(record.initialSource());

@@ -35,13 +35,25 @@ Dictionary cxAsSent(const Dictionary& contact) {
     return PropertyList::fromXML(PropertyList::toXML(contact)).dictionary();
 }
 
+std::optional<Dictionary> cxCommonBase(const std::optional<CXCommonVersion>& common, const Dictionary& here,
+                                       const Dictionary& there) {
+    if (!common) return std::nullopt;
+    if (!common->properties) return here; // not edited since
+    const auto decoded = [](const Bytes& content) { return cxAsSent(BinaryValue::decode(content).dictionary()); };
+    Dictionary base = decoded(*common->properties);
+    for (const auto& sent : common->sent) base = cxBaseAfterSending(base, decoded(*sent), there);
+    return base;
+}
+
 bool ContactWrites::put(const Place& place, const Dictionary& content, int& code) {
     return _manager.write(PropertyList::toXML(content), place.location, CXDVaultraConduit::kSecureRecordWrites, &code);
 }
 
 void ContactWrites::willWrite(const Url& location, const UniqueId& uniqueId,
                               const std::function<Dictionary()>& content) {
-    if (_rolvane.commonVersion(uniqueId) || _manager.remembersVersion(location)) return;
+    const auto common = _rolvane.commonVersion(uniqueId);
+    if (common && common->properties) _rolvane.setSentVersion(uniqueId, encoded(content()));
+    if (common || _manager.remembersVersion(location)) return;
     _new.insert(uniqueId);
     _rolvane.setCommonVersion(uniqueId, encoded(content()));
 }
@@ -102,9 +114,7 @@ bool ContactWrites::writeMerged(const Place& place, const Dictionary& ours, cons
                                 const std::optional<Date>& theirDate, int& code) {
     const auto common = _rolvane.commonVersion(place.uniqueId);
     const Dictionary here = withoutLocation(cxAsSent(ours)), there = withoutLocation(theirs);
-    std::optional<Dictionary> base;
-    if (common) // not edited since: the own content is what both had
-        base = common->properties ? cxAsSent(BinaryValue::decode(*common->properties).dictionary()) : here;
+    const std::optional<Dictionary> base = cxCommonBase(common, here, there);
     const CXSide later = laterSide(common ? common->edited : std::nullopt, theirDate, here, there);
     CXMergeResult merge = mergedContact(base, here, there, later);
     CXDLog("%@ has been changed by somebody else, too: merged", place.location);

@@ -17,6 +17,10 @@ class CXDAVManager;
 
 // The contact as it comes back from a store: dates to the second, for instance.
 Dictionary cxAsSent(const Dictionary& contact);
+// The last version that the database and a store have had in common, for merging `here`, the contact as it is sent, with
+// `there`. None where nothing is known of it.
+std::optional<Dictionary> cxCommonBase(const std::optional<CXCommonVersion>& common, const Dictionary& here,
+                                       const Dictionary& there);
 
 // Writes edited contacts into trees that others write to, too. A version that the client does not know is merged with
 // the own one (contacts/records/ContactMerge.h) before it is written over, and only the version that was read is
@@ -34,7 +38,8 @@ public:
     ContactWrites(CXDAVManager& manager, CXRolvane& rolvane) : _manager(manager), _rolvane(rolvane) {}
 
     // Before the writes of a pass, on its main thread. A contact that no store is known to have had gets this content
-    // as the common version, in the unit of work: should the pass come to no end, the store has it, or has nothing.
+    // as the common version, in the unit of work: should the pass come to no end, the store has it, or has nothing. Of
+    // an edited one the content is kept beside the common version: the store may have either.
     void beginPass() { _new.clear(); }
     void willWrite(const Url& location, const UniqueId& uniqueId, const std::function<Dictionary()>& content);
 

@@ -187,6 +187,9 @@ public:
     std::optional<CXCommonVersion> commonVersion(const UniqueId& uid);
     // Both sides have had these encoded properties. Part of the unit of work. Any thread.
     void setCommonVersion(const UniqueId& uid, std::shared_ptr<const Bytes> properties);
+    // These encoded properties are going to be written to a store, which may have them from then on until a common
+    // version is set, whatever becomes of the process. Part of the unit of work. Any thread.
+    void setSentVersion(const UniqueId& uid, std::shared_ptr<const Bytes> properties);
     std::vector<UniqueId> editedSinceCommon(); // contacts with edits that were not sent, oldest first
     // Values that gave way to others: noted with the next save, or durably on return.
     void noteConflicts(const UniqueId& uid, const std::vector<CXMergeConflict>& conflicts);

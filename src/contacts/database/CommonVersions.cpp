@@ -9,7 +9,16 @@ std::optional<CXCommonVersion> CommonVersions::of(const UniqueId& uid) {
     CXCommonVersion version;
     if (!s.isNull(0)) version.properties = std::make_shared<const Bytes>(s.bytes(0));
     if (!s.isNull(1)) version.edited = Date(s.real(1));
+    if (!version.properties || !hasSentTable()) return version;
+    auto sent = _database.statement(
+        "SELECT properties FROM sent WHERE record_id=(SELECT id FROM records WHERE uid=?) ORDER BY rowid");
+    sent.bind(1, uid.str());
+    while (sent.step()) version.sent.push_back(std::make_shared<const Bytes>(sent.bytes(0)));
     return version;
+}
+
+bool CommonVersions::hasSentTable() {
+    return _database.statement("SELECT 1 FROM sqlite_master WHERE type='table' AND name='sent'").step();
 }
 
 std::vector<UniqueId> CommonVersions::edited() {
@@ -32,6 +41,18 @@ void CommonVersions::set(const UniqueId& uid, const Bytes& properties) {
         "ON CONFLICT(record_id) DO UPDATE SET properties=excluded.properties, "
         "edited=CASE WHEN excluded.properties IS NULL THEN NULL ELSE coalesce(edited, excluded.edited) END");
     s.bind(1, uid.str()).bind(2, properties).run();
+    if (!hasSentTable()) return;
+    _database.statement("DELETE FROM sent WHERE record_id=(SELECT id FROM records WHERE uid=?)")
+        .bind(1, uid.str())
+        .run();
+}
+
+void CommonVersions::addSent(const UniqueId& uid, const Bytes& properties) {
+    if (!hasSentTable()) _database.execute(kSentTable);
+    _database.statement("INSERT OR IGNORE INTO sent SELECT id, ?2 FROM records WHERE uid=?1")
+        .bind(1, uid.str())
+        .bind(2, properties)
+        .run();
 }
 
 } // namespace rolvane

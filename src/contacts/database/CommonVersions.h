@@ -14,10 +14,14 @@ namespace rolvane {
 struct CXCommonVersion {
     std::shared_ptr<const Bytes> properties; // encoded; null: the contact was not edited since
     std::optional<Date> edited;              // the last edit; missing when there was none
+    // Contents of the edited contact, encoded, that were on their way to a store: each may have come there, and nobody
+    // knows. Empty when the contact was not edited.
+    std::vector<std::shared_ptr<const Bytes>> sent = {};
 };
 
-// The table of them: a row for each contact that a store is known to have had. Not locked. The writing operations want
-// an open transaction. A row goes with its contact.
+// The table of them: a row for each contact that a store is known to have had. A second table has what was on its way;
+// it is made when something is put there first. Not locked. The writing operations want an open transaction. Rows go
+// with their contact.
 class CommonVersions {
 public:
     explicit CommonVersions(Sqlite& database) : _database(database) {}
@@ -38,8 +42,18 @@ CREATE INDEX IF NOT EXISTS common_edited ON common(record_id) WHERE properties I
     void keep(int64_t record, const Bytes& before, Date when);
     // Both sides had these properties. Nothing is kept of them while the contact's row says the same.
     void set(const UniqueId& uid, const Bytes& properties);
+    // They are going to be sent; for as long as nothing is set.
+    void addSent(const UniqueId& uid, const Bytes& properties);
 
 private:
+    static constexpr const char* kSentTable = R"(
+CREATE TABLE IF NOT EXISTS sent(
+  record_id INTEGER NOT NULL REFERENCES records(id) ON DELETE CASCADE,
+  properties BLOB NOT NULL,
+  UNIQUE(record_id, properties));
+)";
+    bool hasSentTable();
+
     Sqlite& _database;
 };
 

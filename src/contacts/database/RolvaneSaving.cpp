@@ -34,6 +34,7 @@ public:
             if (!record->deleted) writeRecord(uid, *record);
         writeMemberships(work.memberships());
         for (const auto& [uid, properties] : work.commonVersions()) _commonVersions.set(uid, *properties);
+        for (const auto& [uid, properties] : work.sentVersions()) _commonVersions.addSent(uid, *properties);
         for (const CXConflict& conflict : work.conflicts()) _conflicts.note(conflict);
         if (work.shareCount()) _store.setShareCount(*work.shareCount());
         if (_save) _journal.prune();

@@ -67,6 +67,11 @@ void CXRolvane::setCommonVersion(const UniqueId& uid, std::shared_ptr<const Byte
     _impl->work.setCommonVersion(uid, std::move(properties));
 }
 
+void CXRolvane::setSentVersion(const UniqueId& uid, std::shared_ptr<const Bytes> properties) {
+    std::lock_guard lock(_impl->mutex);
+    _impl->work.setSentVersion(uid, std::move(properties));
+}
+
 std::vector<UniqueId> CXRolvane::editedSinceCommon() {
     std::lock_guard lock(_impl->mutex);
     return _impl->commonVersions.edited();

@@ -50,6 +50,7 @@ void UnitOfWork::clear() {
     _memberships.clear();
     _shareCount.reset();
     _commonVersions.clear();
+    _sentVersions.clear();
     _conflicts.clear();
     _size = 0;
 }
@@ -64,6 +65,11 @@ void UnitOfWork::replace(PendingRecord& record, const Dictionary& properties) {
 
 void UnitOfWork::setCommonVersion(const UniqueId& uid, std::shared_ptr<const Bytes> properties) {
     _commonVersions[uid] = std::move(properties);
+    _sentVersions.erase(uid);
+}
+
+void UnitOfWork::setSentVersion(const UniqueId& uid, std::shared_ptr<const Bytes> properties) {
+    _sentVersions[uid] = std::move(properties);
 }
 
 const PendingRecord* UnitOfWork::find(const UniqueId& uid) const {
@@ -100,6 +106,7 @@ void UnitOfWork::remove(const UniqueId& uid, RecordKind kind, bool inStore, Date
         at = drop ? _memberships.erase(at) : std::next(at);
     }
     _commonVersions.erase(uid);
+    _sentVersions.erase(uid);
     PendingRecord& record = touch(uid, kind, inStore, now);
     if (record.whole) _size -= record.whole->size();
     record.whole.reset();

@@ -57,7 +57,7 @@ class UnitOfWork {
 public:
     bool empty() const {
         return _records.empty() && _memberships.empty() && !_shareCount && _commonVersions.empty() &&
-               _conflicts.empty();
+               _sentVersions.empty() && _conflicts.empty();
     }
     void clear();
 
@@ -89,6 +89,8 @@ public:
     using CommonVersionsOf = std::unordered_map<UniqueId, std::shared_ptr<const Bytes>>;
     const CommonVersionsOf& commonVersions() const { return _commonVersions; }
     void setCommonVersion(const UniqueId& uid, std::shared_ptr<const Bytes> properties);
+    const CommonVersionsOf& sentVersions() const { return _sentVersions; } // on their way
+    void setSentVersion(const UniqueId& uid, std::shared_ptr<const Bytes> properties);
     const std::vector<CXConflict>& conflicts() const { return _conflicts; }
     void addConflict(CXConflict conflict) { _conflicts.push_back(std::move(conflict)); }
 
@@ -99,7 +101,7 @@ private:
     std::unordered_map<UniqueId, PendingRecord> _records;
     std::map<UniqueId, PendingMembership> _memberships;
     std::optional<int64_t> _shareCount;
-    CommonVersionsOf _commonVersions;
+    CommonVersionsOf _commonVersions, _sentVersions;
     std::vector<CXConflict> _conflicts;
     uint64_t _nextOrder = 1;
     size_t _size = 0;

@@ -163,6 +163,37 @@ Value mergedList(const Value& base, const Value& ours, const Value& theirs) {
     return result;
 }
 
+Value sentMultiValue(const Value& base, const Value& sent, const Value& theirs) {
+    const Entries before = entriesOf(base), ours = entriesOf(sent), there = entriesOf(theirs);
+    const auto oursOf = counterparts(before, ours), theirsOf = counterparts(before, there);
+    const auto sentOfTheirs = counterparts(there, ours);
+    const auto cameAsSent = [&](size_t t) { return sentOfTheirs[t] != kNone && says(there[t], ours[sentOfTheirs[t]]); };
+    CXMutableMultiValue result;
+    const auto add = [&](const CXMultiValue::Entry& entry) {
+        result.addValue(entry.value, entry.label, entry.identifier);
+    };
+    std::vector<bool> isOfBase(there.size(), false);
+    for (size_t b = 0; b < before.size(); ++b) {
+        const size_t t = theirsOf[b];
+        if (t != kNone) isOfBase[t] = true;
+        if (t == kNone && oursOf[b] == kNone) continue; // both have removed it
+        add(t != kNone && cameAsSent(t) ? there[t] : before[b]);
+    }
+    for (size_t t = 0; t < there.size(); ++t)
+        if (!isOfBase[t] && cameAsSent(t)) add(there[t]);
+    return result.toValue();
+}
+
+Value sentList(const Value& base, const Value& sent, const Value& theirs) {
+    const Array before = base.array(), ours = sent.array(), there = theirs.array();
+    Array result;
+    for (const Value& text : before)
+        if (ours.contains(text) || there.contains(text)) result.append(text);
+    for (const Value& text : there)
+        if (!before.contains(text) && ours.contains(text)) result.append(text);
+    return result;
+}
+
 class ContactMerging {
 public:
     ContactMerging(const Dictionary& base, const Dictionary& ours, const Dictionary& theirs, CXSide later)
@@ -232,6 +263,30 @@ CXMergeResult mergedContact(const std::optional<Dictionary>& base, const Diction
                             CXSide later) {
     const Dictionary before = base.value_or(Dictionary());
     return ContactMerging(before, ours, theirs, later).result();
+}
+
+Dictionary cxBaseAfterSending(const Dictionary& base, const Dictionary& sent, const Dictionary& theirs) {
+    Dictionary result = base.mutableCopy();
+    std::set<std::string> names;
+    for (const Dictionary& side : {base, sent, theirs})
+        for (const auto& [name, value] : side) names.insert(name);
+    const auto areAllOf = [&](const std::string& name, auto is) {
+        return areAll(base[name], sent[name], theirs[name], is) || areAll(sent[name], base[name], theirs[name], is);
+    };
+    for (const std::string& name : names) {
+        Value both = base[name];
+        if (sent[name] == theirs[name])
+            both = theirs[name];
+        else if (areAllOf(name, [](const Value& v) { return CXMultiValue::isMultiValue(v); }))
+            both = sentMultiValue(base[name], sent[name], theirs[name]);
+        else if (areAllOf(name, isListOfStrings))
+            both = sentList(base[name], sent[name], theirs[name]);
+        if (both)
+            result.set(name, both);
+        else
+            result.remove(name);
+    }
+    return result;
 }
 
 CXSide laterSide(const std::optional<Date>& ours, const std::optional<Date>& theirs, const Dictionary& ourContact,

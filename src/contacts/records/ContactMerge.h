@@ -41,6 +41,11 @@ struct CXMergeResult {
 CXMergeResult mergedContact(const std::optional<Dictionary>& base, const Dictionary& ours, const Dictionary& theirs,
                             CXSide later);
 
+// The base for merging with `theirs` where `sent`, a later version of ours, may have come to the other side or not. An
+// entry or single value of theirs that is as it was sent was had by both; so was an entry missing on purpose. All else
+// is as in `base`. Pure; the result shares its containers with the arguments.
+Dictionary cxBaseAfterSending(const Dictionary& base, const Dictionary& sent, const Dictionary& theirs);
+
 // The side of the later date. Of equal dates, and where one is missing, the side whose content is the greater one as
 // encoded bytes: whoever merges comes to the same.
 CXSide laterSide(const std::optional<Date>& ours, const std::optional<Date>& theirs, const Dictionary& ourContact,
