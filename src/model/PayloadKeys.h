@@ -32,5 +32,7 @@ inline constexpr const char* kRefusedByStore = "refusedByStore";
 // And: owner marker -> false when the owner's published tree has lost what it held, so that the next scan takes
 // everything for new; true from that scan on until all of it is written.
 inline constexpr const char* kPublishAgain = "publishAgain";
+// In that: true where the tree was set back to an older copy, so that nothing in it is anybody's news.
+inline constexpr const char* kOlderCopy = "olderCopy";
 
 } // namespace rolvane

@@ -69,6 +69,30 @@ TEST_F(LastContact, ThatTheOwnerDeletesLeavesTheStoreAndTheReader) {
     expectThatTheTreeStillWorks();
 }
 
+// Its file is gone, and its name waits. For its owner that is no lost tree, whose groups would all be made anew.
+TEST_F(LastContact, WhoseNameAWriterCouldNotTakeOutYetLeavesWithAGroupThatIsDeletedMeanwhile) {
+    settle(alice, bob);
+    for (size_t i = 0; i < 2; ++i) remove(bob, copyOf(people[i]->uniqueId()));
+    settle(bob, alice);
+    remove(bob, copyOf(people[2]->uniqueId()));
+    bob.wire->intercept([](const HttpRequest& request) -> std::optional<HttpResponse> {
+        if (request.method != "PUT" || !request.url.encodedPath().ends_with("AllCXGroup")) return std::nullopt;
+        HttpResponse failed;
+        failed.status = 500;
+        return failed;
+    });
+    bob.pass();
+    bob.wire->intercept({});
+    ASSERT_FALSE(bob.engine->getPendingChanges().empty()) << log.text();
+    alice.pass();
+    remove(bob, copyOf(friends->uniqueId()));
+    settle(bob, alice);
+    settle(bob, alice);
+    EXPECT_FALSE(alice.application->recordForUniqueId(friends->uniqueId())) << log.text();
+    expectNobodyAnywhere();
+    expectThatTheTreeStillWorks();
+}
+
 TEST_F(LastContact, ThatAWriterDeletesLeavesTheStoreAndTheOwner) {
     settle(alice, bob);
     for (const UniqueId& each : identifiers()) {

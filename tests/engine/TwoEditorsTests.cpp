@@ -197,6 +197,25 @@ TEST_F(TwoEditors, AContactThatIsDeletedBeforeItIsMergedDoesNotBecomeThePersonsO
     EXPECT_EQ(copies(), alice.view()) << log.text();
 }
 
+// A tree that has lost something is no older copy: the contacts that lie there are everybody's latest.
+TEST_F(TwoEditors, InATreeThatHasLostAGroupBothEditsAreKept) {
+    const auto loseTheGroup = [&] { std::filesystem::remove_all(world->file(friends->uniqueId().str())); };
+    for (Participant* first : {&alice, &bob}) {
+        Participant* second = first == &alice ? &bob : &alice;
+        edit(*first, kCXOrganizationProperty, "O" + first->name);
+        first->pass();
+        loseTheGroup();
+        edit(*second, kCXNicknameProperty, "N" + first->name);
+        second->pass();
+        EXPECT_TRUE(log.mentions("has lost a group that it still names")) << log.text();
+        settle();
+        settle();
+        expectEverywhere(kCXOrganizationProperty, "O" + first->name);
+        expectEverywhere(kCXNicknameProperty, "N" + first->name);
+        expectEqualAndQuiet();
+    }
+}
+
 class RenamedDuringThePass : public TwoEditors {
 protected:
     CXGroupRef copy() {

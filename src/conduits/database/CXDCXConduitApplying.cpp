@@ -234,10 +234,11 @@ bool CXDCXConduit::createStructureForGroup(const CXDChangeRecordPtr& record) {
 bool CXDCXConduit::changeGroupName(const CXDChangeRecordPtr& record) {
     if (namesAllGroup(*record)) return true;
     const CXGroupRef group = groupOf(*record);
-    if (!group || isRenamedHere(*record, *group)) return true;
+    const Value name = record->payload();
+    if (!group || !name || isRenamedHere(*record, *group)) return true;
     // As a replacement: a name that another program gives until the pass is saved stays.
     Dictionary content = group->dictionaryRepresentation().mutableCopy();
-    content.set(kCXGroupNameProperty, record->payload());
+    content.set(kCXGroupNameProperty, name);
     group->resetWithDictionary(content, false, false);
     return true;
 }

@@ -120,7 +120,7 @@ void CXDVaultraConduit::open() {
     _world.manager.useVersionMemoryOf(database().databaseIdentity(), database().shareCount());
     _writes.giveUpMerged(); // of a pass that failed
     _setBack.clear();
-    _publishesAgain = !engine().conduitObjectForKey(kConduitCX, kPublishAgain).empty();
+    _isOlderCopy = engine().conduitObjectForKey(kConduitCX, kPublishAgain)[kOlderCopy].boolean();
     const int code = testReachability(gathering ? [this] { beginReading(); } : std::function<void()>());
     if (code == kCXDAVErrorAuthentication) {
         if (shouldWarnUserAboutUserNameOrPassword()) {

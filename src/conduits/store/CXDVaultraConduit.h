@@ -16,6 +16,8 @@
 
 namespace rolvane {
 
+struct TreeCondition;
+
 class CXDAVManager;
 class CXNetworkController;
 class CXRolvane;
@@ -123,7 +125,7 @@ private:
     void beginReading();
     void lookAfterStructure(bool meanwhile); // while the pass goes on
     void awaitStructure();                   // any thread
-    void publishAgain();
+    void publishAgain(const TreeCondition& condition);
     void restoreAccessLists();
     bool isMended(const Dictionary& prior, const Dictionary& state);
     bool isToBePublishedAgain();
@@ -161,7 +163,7 @@ private:
     ContactWrites _writes{_world.manager, _world.rolvane};
     std::atomic<bool> _vaultraOffLine = false;
     std::atomic<bool> _isWrittenByOthers = false; // the own tree, as of the last open
-    std::atomic<bool> _publishesAgain = false;    // the own tree: it is older than the database
+    std::atomic<bool> _isOlderCopy = false;       // the own tree: it is older than the database
     std::set<UserName> _setBack;                  // other trees that are, as this pass has seen; main thread
     CXDChangeRecords _leftovers;                  // of the gathering that is under way
     std::map<UserName, Dictionary> _read;         // so far: the states of known users

@@ -130,7 +130,7 @@ UniqueId CXDVaultraConduit::inDatabase(const CXDChangeRecord& record) {
 
 // Where nobody else writes there is nothing to merge with. What an older copy of a tree holds is no news.
 bool CXDVaultraConduit::mergesInto(const UserName& user) {
-    if (user == kSelf) return _isWrittenByOthers && !_publishesAgain;
+    if (user == kSelf) return _isWrittenByOthers && !_isOlderCopy;
     return !_setBack.contains(user);
 }
 

@@ -49,7 +49,7 @@ bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state)
           isOwn ? "It is published again." : "It is left alone until its owner has mended it.");
     if (condition.kind == TreeCondition::Kind::setBack) prior.set(kTreeDates, datesToWaitFor(state));
     if (!isOwn) {
-        _setBack.insert(user);
+        if (condition.kind == TreeCondition::Kind::setBack) _setBack.insert(user);
         return false;
     }
     const bool isRefused = !engine().conduitObjectForKey(kConduitCX, kRefusedByStore).empty();
@@ -59,7 +59,7 @@ bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state)
     if (condition.mayPass() && !looked)
         prior.set(kLookAgain, true);
     else
-        publishAgain();
+        publishAgain(condition);
     engine().bringSourcesUpToDate(); // after this pass
     return false;
 }
@@ -128,7 +128,7 @@ CXDChangeRecords CXDVaultraConduit::changeRecords() {
     CXDChangeRecords records = CXDConduit::changeRecords();
     if (_world.rolvane.allGroup()->valueForProperty(kCXRemoteLocationProperty) && endedPublication(_world.preferences))
         _world.preferences.remove(kDaemonDomain, kCXDEndedPublication); // published again since
-    _publishesAgain = !engine().conduitObjectForKey(kConduitCX, kPublishAgain).empty();
+    _isOlderCopy = engine().conduitObjectForKey(kConduitCX, kPublishAgain)[kOlderCopy].boolean();
     leaveUnlistedOut(records);
     compareUnlistedGroups(records);
     _read.clear();
@@ -188,8 +188,10 @@ void CXDVaultraConduit::leaveUnlistedOut(CXDChangeRecords& records) {
 }
 
 // The next scan takes everything for new.
-void CXDVaultraConduit::publishAgain() {
-    engine().conduitObjectForKey(kConduitCX, kPublishAgain).set(kSelf.str(), false);
+void CXDVaultraConduit::publishAgain(const TreeCondition& condition) {
+    Dictionary again = engine().conduitObjectForKey(kConduitCX, kPublishAgain);
+    again.set(kSelf.str(), false);
+    if (condition.kind == TreeCondition::Kind::setBack) again.set(kOlderCopy, true);
     restoreAccessLists();
 }
 

@@ -32,7 +32,8 @@ struct TreeCondition {
         lostLists,    // there were contacts, and what said so is gone
         replacedList, // another list stands there, and all whom it does not name any longer still lie there
         lostAGroup,   // one that the tree's own lists still name; for a moment so while somebody deletes it
-        lostContacts, // there were contacts, their list names some, and there is not one file of one
+        lostContacts, // there were contacts, their list names some, and there is not one file of one; to its owner they
+                      // are single ones that are missing
     };
     Kind kind = Kind::sound;
     std::string sentence; // what is wrong, for a log; empty when nothing is
