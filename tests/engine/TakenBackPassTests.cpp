@@ -212,6 +212,25 @@ TEST_F(TakenBackPass, ANewGroupKeepsTheNameThatItIsGivenDuringTheNextPass) {
     EXPECT_EQ(crew->name(), "Band") << log.text();
 }
 
+TEST_F(TakenBackPass, ANewGroupThatIsDeletedDuringTheNextPassStaysDeleted) {
+    const CXGroupRef crew = alice.group("Crew", {people[1]});
+    passThatIsTakenBack(alice);
+    const UniqueId uid = crew->uniqueId();
+    bool removed = false;
+    alice.wire->intercept([&](const HttpRequest& request) -> std::optional<HttpResponse> {
+        const bool isTheGroup = request.url.encodedPath().find(std::string(cxUUIDPart(uid))) != std::string::npos;
+        if (request.method == "PUT" && isTheGroup && !std::exchange(removed, true)) remove(alice, crew);
+        return std::nullopt;
+    });
+    alice.pass();
+    alice.wire->intercept({});
+    ASSERT_TRUE(removed) << log.text();
+    alice.database->deliverExternalChanges();
+    settle();
+    EXPECT_FALSE(alice.application->recordForUniqueId(uid)) << log.text();
+    EXPECT_FALSE(std::filesystem::exists(world->file(uid.str())));
+}
+
 // Its absence in a database with another subscription is nobody's doing.
 TEST_F(TakenBackPass, WhatANewSubscriptionHasNotBroughtYetIsNotDeleted) {
     const CXPersonRef dora = addToAlices("Dora");

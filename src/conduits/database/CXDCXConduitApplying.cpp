@@ -220,6 +220,10 @@ bool CXDCXConduit::createStructureForGroup(const CXDChangeRecordPtr& record) {
         CXDLog("%@ names a record that is not its own; left as it is", record);
         return true;
     }
+    if (!there && hasUncapturedEdit(uid)) {
+        CXDLog("%@ has been deleted here meanwhile", record);
+        return true;
+    }
     const Dictionary content = contentOf(*record);
     const CXGroupRef group = CXGroup::initWithUniqueId(uid);
     if (cxIsSubscribed(uid)) group->setValue(content[kCXRemoteLocationProperty], kCXRemoteLocationProperty);
