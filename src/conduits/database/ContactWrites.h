@@ -17,7 +17,7 @@ class CXDAVManager;
 
 // The contact as it comes back from a store: dates to the second, for instance.
 Dictionary cxAsSent(const Dictionary& contact);
-// The last version that the database and a store have had in common, for merging `here`, the contact as it is sent, with
+// The last version that the database and a store have had in common, for merging `here`, as it is sent, with
 // `there`. None where nothing is known of it.
 std::optional<Dictionary> cxCommonBase(const std::optional<CXCommonVersion>& common, const Dictionary& here,
                                        const Dictionary& there);
