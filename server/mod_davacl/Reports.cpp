@@ -315,7 +315,7 @@ apr_xml_doc* othersIn(const Report& q, const std::vector<Wanted>& wanted) {
     doc->root = element("propfind", APR_XML_NS_DAV_ID);
     doc->root->first_child = element("prop", APR_XML_NS_DAV_ID);
     for (const Wanted& each : wanted) {
-        const char* space = apr_pstrdup(pool, each.space.c_str());
+        const char* space = apr_xml_quote_string(pool, each.space.c_str(), 1); // as apr's own parser gives them
         apr_xml_elem* made = element(each.name.c_str(), apr_xml_insert_uri(doc->namespaces, space));
         made->next = doc->root->first_child->first_child;
         doc->root->first_child->first_child = made;

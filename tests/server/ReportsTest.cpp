@@ -146,6 +146,15 @@ TEST_F(Reports, ExpandPropertyTellsOfPrincipalsWhatPropfindTells) {
     EXPECT_EQ(report("sam", kTree, "expand-property", members).status, 403);
 }
 
+TEST_F(Reports, ExpandPropertyQuotesTheNamespacesThatItIsAskedFor) {
+    for (const char* path : {"/dav/alice/Contacts/dateFile", "/principals/users/greta"}) {
+        const std::string text =
+            body(report("greta", path, "expand-property",
+                        "<D:property name=\"none\" namespace=\"urn:&quot;/&gt;&lt;y&gt;&amp;z\"/>"));
+        EXPECT_THAT(text, AllOf(HasSubstr("urn:&quot;/&gt;&lt;y&gt;&amp;z"), Not(HasSubstr("urn:\""))));
+    }
+}
+
 TEST_F(Reports, ExpandPropertyHasBounds) {
     std::string deep = "<D:property name=\"displayname\"/>";
     for (int i = 0; i < 9; ++i) deep = "<D:property name=\"principal-URL\">" + deep + "</D:property>";
