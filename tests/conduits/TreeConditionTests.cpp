@@ -163,6 +163,25 @@ TEST(TreeCondition, AGroupThatIsNowhereIsTakenOutOfTheGroupsThatNameIt) {
     EXPECT_TRUE(namesAlone(now, now, nobody).empty()) << "single groups are published";
 }
 
+TEST(TreeCondition, ANameOfEverybodysListWithoutAContactIsTakenOutWhenItStandsForTwoVisits) {
+    Dictionary now = tree();
+    const auto isHere = [](const UniqueId& uid) { return uid.str() != "gone:CXPerson"; };
+    EXPECT_TRUE(namesAlone(now, now, isHere).empty());
+    Array names = now["AllCXGroup"].dictionary()[kMemberUIDState].array().mutableCopy();
+    names.append("gone:CXPerson");
+    now.dictionaryFor("AllCXGroup").set(kMemberUIDState, names);
+    const Dictionary alone = namesAlone(tree(), now, isHere);
+    EXPECT_EQ(alone, (Dictionary{{"AllCXGroup", Array{"gone:CXPerson"}}}));
+    EXPECT_TRUE(removalOfNamesAlone(now, alone).empty()) << "somebody is deleting it";
+    Dictionary seen = now;
+    seen.set(kNamesAlone, alone);
+    const CXDChangeRecords removals = removalOfNamesAlone(seen, alone);
+    ASSERT_EQ(removals.size(), 1u);
+    EXPECT_EQ(removals[0]->type(), CXDRemoveRecordFromGroup);
+    EXPECT_EQ(removals[0]->person(), UniqueId("gone:CXPerson"));
+    EXPECT_EQ(removals[0]->group(), UniqueId("AllCXGroup"));
+}
+
 TEST(TreeCondition, WhatClosesACircleInTheOwnersDatabaseIsTakenOutWhenItStandsForTwoVisits) {
     std::map<UniqueId, std::vector<UniqueId>> here{{UniqueId("A:CXGroup"), {UniqueId("B:CXGroup")}},
                                                    {UniqueId("B:CXGroup"), {UniqueId("C:CXGroup")}}};

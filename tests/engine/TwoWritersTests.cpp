@@ -258,6 +258,26 @@ TEST_F(TwoWriters, AContactThatLiesInTheTreeAndIsInNoListIsTakenInByNobodyAndTak
     for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
 }
 
+// Its owner had put it there and deleted it before the list of everybody named it; a reader that may write has listed
+// the copy, which had come with a group.
+TEST_F(TwoWriters, AContactThatIsNowhereAndThatAWriterHasListedIsNamedNoLonger) {
+    bob.pass();
+    const UniqueId gone("5C0FFEE5-0000-4000-8000-000000000001:CXPerson");
+    auto change = std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, CXDAddRecordToGroup, UserName("alice"), gone,
+                                                    UniqueId(kCXAllGroupUID));
+    change->setAppliesToSources(CXDSyncSourceVaultra);
+    bob.engine->applyChangeRecords({change}, true);
+    const auto listed = [&] {
+        return stateOf(UniqueId(kCXAllGroupUID))["memberUIDState"].array().containsString(gone.str());
+    };
+    ASSERT_TRUE(listed()) << log.text();
+    for (int round = 0; round < 3; ++round)
+        for (Participant* each : {&alice, &bob}) each->pass();
+    EXPECT_FALSE(listed()) << log.text();
+    EXPECT_EQ(copies(), alice.view()) << log.text();
+    for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
+}
+
 TEST_F(TwoWriters, AContactsFileThatTheStoreHasLostIsWrittenAgainByItsOwner) {
     bob.pass();
     const auto file = fileOf(people[1]);

@@ -200,6 +200,10 @@ Dictionary namesAlone(const Dictionary& prior, const Dictionary& current,
                     [&](const UniqueId& uid) { return !current[uid.str()].dictionary().empty(); });
         if (!names.empty()) alone.set(name, names);
     }
+    Array nowhere;
+    for (const UniqueId& uid : contactsThatAreMissing(current))
+        if (!isHere(uid)) nowhere.append(uid);
+    if (!nowhere.empty()) alone.set(kEverybody, nowhere);
     return alone;
 }
 
@@ -240,9 +244,8 @@ CXDChangeRecords removalOfNamesAlone(const Dictionary& prior, const Dictionary& 
     for (const auto& [group, names] : alone)
         for (const Value& name : names.array()) {
             const UniqueId uid(name.string());
-            if (peopleBefore.contains(uid) || groupsBefore.contains(uid) ||
-                before[group].array().containsString(name.string()))
-                remove(group, name);
+            const bool wasListed = group != kEverybody && (peopleBefore.contains(uid) || groupsBefore.contains(uid));
+            if (wasListed || before[group].array().containsString(name.string())) remove(group, name);
         }
     for (const auto& [group, names] : circles)
         for (const Value& name : names.array())

@@ -70,7 +70,8 @@ CXDChangeRecords removalOfUnlistedGroups(const Dictionary& prior, const Dictiona
 
 // The contacts and groups that groups name though neither the list of everybody nor a file does: group -> array of
 // names. Somebody has put them there while somebody else deleted them; or a new one's file is still to come. `isHere`:
-// the owner's database has it; one that the list has lost since `prior` is about to leave it.
+// the owner's database has it; one that the list has lost since `prior` is about to leave it. And the contacts that the
+// list of everybody itself names, and that are neither there nor here: they were deleted before it named them.
 Dictionary namesAlone(const Dictionary& prior, const Dictionary& current,
                       const std::function<bool(const UniqueId& name)>& isHere);
 
