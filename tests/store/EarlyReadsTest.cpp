@@ -260,25 +260,27 @@ TEST_F(ReadingEarly, AListingWithABucketThatFailsIsNothingWhateverPartsWereTold)
 }
 
 TEST_F(ReadingEarly, AListingThatWasBegunAsksNothingTwiceAndServesOneListing) {
-    client.manager.expectListing(client.base);
-    const auto begun = client.manager.infoForFilesInContainer(client.base);
-    const size_t asked = client.wire->count("PROPFIND");
-    EXPECT_EQ(asked, 34u) << client.wire->text();
-    client.wire->clear();
+    Client fresh(*world); // nobody has told it yet that the store tells changes
+    fresh.manager.expectListing(fresh.base);
+    const auto begun = fresh.manager.infoForFilesInContainer(fresh.base);
+    const size_t asked = fresh.wire->count("PROPFIND");
+    EXPECT_EQ(asked, 34u) << fresh.wire->text();
+    fresh.wire->clear();
     Client other(*world);
     ASSERT_EQ(other.write("People/7/new:CXPerson", Dictionary{{"number", 1}}), 201);
-    const auto later = client.manager.infoForFilesInContainer(client.base);
+    const auto later = fresh.manager.infoForFilesInContainer(fresh.base);
     ASSERT_TRUE(begun && later);
     EXPECT_EQ(later->size(), begun->size() + 1) << "the store is asked again";
     other.manager.removeFileAtURL(other.at("People/7/new:CXPerson"), nullptr);
 }
 
 TEST_F(ReadingEarly, AListingThatFailedWhenItWasBegunIsNothing) {
-    client.wire->intercept([](const HttpRequest& request) {
+    Client fresh(*world);
+    fresh.wire->intercept([](const HttpRequest& request) {
         return request.method == "PROPFIND" ? std::optional(answerOf(500)) : std::nullopt;
     });
-    client.manager.expectListing(client.base);
-    client.wire->intercept(nullptr);
-    EXPECT_FALSE(client.manager.infoForFilesInContainer(client.base));
-    EXPECT_TRUE(client.manager.infoForFilesInContainer(client.base));
+    fresh.manager.expectListing(fresh.base);
+    fresh.wire->intercept(nullptr);
+    EXPECT_FALSE(fresh.manager.infoForFilesInContainer(fresh.base));
+    EXPECT_TRUE(fresh.manager.infoForFilesInContainer(fresh.base));
 }

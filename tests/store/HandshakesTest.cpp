@@ -106,10 +106,13 @@ constexpr auto kAtOnce = std::chrono::milliseconds(0);
 
 TEST(Handshakes, ThatTheServerEndsAreBegunOnceMoreWhateverTheMethod) {
     const StoreWorld world;
+    CurlTransportOptions options;
+    options.caFile = world.store.caFile();
+    options.http2 = false; // there a body that was refused unread is sent once more, on another connection
     for (const char* method : {"GET", "HEAD", "OPTIONS", "PROPFIND", "PUT", "DELETE", "MKCOL", "UNLOCK", "ACL",
                                "PROPPATCH", "LOCK", "COPY", "MOVE", "REPORT"}) {
         const Doorkeeper door(world.store.status().port, 1, kAtOnce);
-        const HttpResponse answer = world.transport()->perform(door.asking(method));
+        const HttpResponse answer = CurlTransport(options).perform(door.asking(method));
         EXPECT_EQ(answer.error, TransportError::none) << method << ": " << answer.detail;
         EXPECT_EQ(answer.status, 401) << method << ": the door is another origin, which gets no password";
         EXPECT_EQ(door.connections(), 2) << method;
