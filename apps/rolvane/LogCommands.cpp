@@ -47,7 +47,7 @@ UniqueId findInHistory(CXRolvane& database, const std::string& named) {
     return findPerson(database, named)->uniqueId(); // a part of a name, or the error that says what there is
 }
 
-// Who made the change: this computer's program, a device, or somebody on the store.
+// The author of the change: this computer's program, a device, or somebody on the store.
 std::string byWhom(CXRolvane& database, const CXLoggedChange& change, const std::vector<CXChangeDetail>& details) {
     if (change.program == kHere)
         return change.command.empty() ? "here" : fmt::format("here, `rolvane {}`", change.command);

@@ -61,7 +61,7 @@ void withdrawAll(Publication& publication) {
     for (const CXGroupRef& single : publication.groups()) publication.withdrawGroup(single);
 }
 
-// What everybody who reads would see that nobody has seen before. The database stays as it is.
+// The people and groups that would be new to the readers. The database stays as it is.
 Shown newlyShown(CXRolvane& database, const CXGroupRef& group, const Url& base) {
     Publication publication(database);
     const Shown before = shownToReaders(database);

@@ -10,7 +10,7 @@
 
 namespace rolvane::cli {
 
-// What every reader of the owner's tree gets of the contact database as it is, unsaved changes included.
+// Each reader of the owner's tree gets this of the contact database as it is, unsaved changes included.
 struct Shown {
     std::set<UniqueId> people;
     std::vector<CXGroupRef> groups; // by name
@@ -27,7 +27,7 @@ std::string usersText(const std::vector<std::string>& users);
 void declareTrial(CLI::App& command, bool& dryRun);
 nlohmann::ordered_json trialJson(const Shown& what, const std::vector<std::string>& users);
 
-// What is in the one and not in the other.
+// The part of the first that is missing in the second.
 Shown without(const Shown& all, const Shown& those);
 
 } // namespace rolvane::cli

@@ -23,8 +23,8 @@ struct DirectoryIndex {
         int64_t appeared = 0;   // when it came, or another one took its place; of a collection
     };
     struct Head {
-        uint64_t sums[2] = {0, 0}; // of the signatures of what is there, in two lanes
-        uint64_t count = 0;        // of what is there
+        uint64_t sums[2] = {0, 0}; // of the signatures of present members, in two lanes
+        uint64_t count = 0;        // of present members
         int64_t since = 0;         // departures up to this number have been forgotten
         int64_t last = 0;          // the highest number in it
     };

@@ -9,7 +9,7 @@ namespace rolvane::davacl {
 
 // Up to where somebody knows the members of a collection (RFC 6578 section 4).
 //   urn:x-rolvane:tree:<d|s>:<epoch>:<scope>:<number>:<time>[:<hash>:<base>:<time of the last whole answer>:<0|1>]
-// with numbers in hexadecimal. Whoever makes one up is told of what may be read and nothing else.
+// with numbers in hexadecimal. A made-up token gets nothing but readable members.
 struct SyncToken {
     bool isDeep = false;
     uint64_t epoch = 0;    // of the journal

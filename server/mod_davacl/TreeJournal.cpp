@@ -115,7 +115,7 @@ std::string hex(uint64_t number) {
     return text;
 }
 
-// What is noted becomes what the disk has; the number goes to what differs.
+// The notes become the state of the disk; each difference gets the number.
 void update(DirectoryIndex& index, const DiskState& disk, int64_t number) {
     std::vector<DirectoryIndex::Record> fresh;
     fresh.reserve(std::max(index.records.size(), disk.entries.size()));

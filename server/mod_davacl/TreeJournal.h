@@ -12,7 +12,7 @@
 
 namespace rolvane::davacl {
 
-// What has changed in an owner's tree, told by comparison of the disk with what was noted of it before. The disk is the
+// The changes in an owner's tree, told by comparison of the disk with what was noted of it before. The disk is the
 // truth: whoever changes something, mod_dav, a killed process or root's editor, is seen by the next look. A look costs
 // a `stat` a member; of a directory whose sums are as they were nothing is read nor written.
 //

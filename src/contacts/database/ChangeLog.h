@@ -24,7 +24,7 @@ struct CXChangeDetail {
     std::shared_ptr<const Bytes> before;
 };
 
-// What one command, or one save of another program, has changed.
+// The changes of one command, or of one save of another program.
 struct CXLoggedChange {
     int64_t number = 0;
     Date date; // of the first save of it

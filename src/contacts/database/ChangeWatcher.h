@@ -26,7 +26,7 @@ public:
     static void touch(const std::string& databasePath);
 
 private:
-    // What a saver leaves behind: times and numbers of the database, of the file that is touched, and of the log.
+    // Traces of a save: times and numbers of the database, of the file that is touched, and of the log.
     struct Marks {
         std::string touched, log;
         bool operator==(const Marks&) const = default;

@@ -8,7 +8,7 @@
 
 namespace rolvane {
 
-// What came of taking a change back.
+// The result of taking a change back.
 struct CXUndone {
     size_t broughtBack = 0, removed = 0, changed = 0, memberships = 0;
     size_t asOwn = 0;              // of those brought back: copies of somebody who shares no more, or allows no writing

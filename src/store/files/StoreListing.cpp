@@ -279,7 +279,7 @@ StoreListing::AskedRef StoreListing::askForChanges(const Url& tree) {
     return asked;
 }
 
-// What the memory has of the tree once it is up to date.
+// The tree as the memory has it, once that is up to date.
 std::optional<FileListing> StoreListing::listChanged(const Url& tree, AskedRef begun) {
     SyncedListing synced(_session, _listings);
     if (!begun || !begun->isOfChanges) begun = askForChanges(tree);
@@ -319,7 +319,7 @@ std::optional<FileListing> StoreListing::list(const Url& container, const AskedR
     if (isBaseLocation(container) && _session.maySynchronize()) {
         if (!_listings.token(container).empty())
             if (auto out = listChanged(container, begun)) return out;
-        // What changes while the tree is listed is told again by this token.
+        // This token tells changes during the listing once more.
         token = SyncedListing(_session, _listings).tokenOf(container);
         if (!token.empty()) _listings.forgetBelow(container);
     }

@@ -28,7 +28,7 @@ public:
     // Containers that the store was asked to list, with the answers as they come.
     struct Asked;
     using AskedRef = std::shared_ptr<Asked>;
-    // What `list` of the container asks first. Does not wait. Null where a token has to be asked for before.
+    // Asks the first questions of `list`. Does not wait. Null where a token has to be asked for before.
     AskedRef begin(const Url& container);
     // As CXFileManager::infoForFilesInContainer; `begun`: goes on from there; `part`: as of
     // infoForFilesInContainerByParts.

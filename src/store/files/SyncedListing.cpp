@@ -32,7 +32,7 @@ std::string quoted(const std::string& text) {
     return out;
 }
 
-// What the listing of a tree needs: the tree, "People" and the buckets, and each group's state.
+// The listing of a tree needs the tree, "People" and the buckets, and each group's state.
 bool isListed(const std::vector<std::string>& below) {
     const bool inPeople = below.front() == "People";
     return below.size() == 1 || (inPeople && below.size() <= 3) ||
