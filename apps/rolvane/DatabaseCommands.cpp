@@ -1,3 +1,4 @@
+#include "Consent.h"
 #include "Context.h"
 
 #include "contacts/database/DamagedDatabase.h"
@@ -8,14 +9,21 @@ namespace rolvane::cli {
 // The store keeps what was published: nothing of the new database is known to be its former contents, so nothing is
 // deleted there, and the daemon forgets what it knew when it meets another database.
 void addDatabaseCommands(CLI::App& app, Context& context) {
+    const auto yes = std::make_shared<bool>(false);
     addCommand(
         app, context, "new-database",
         "Begin with an empty contact database where the former one is gone. What is published stays on the store "
         "until it is published anew",
-        {}, [&context] {
+        [yes](CLI::App& command) { declareConsent(command, *yes); },
+        [&context, yes] {
+            requireNoDatabase({});
+            requireConsent(context, *yes,
+                           "Begin with 0 contacts? The former database is lost but for a backup, which `rolvane "
+                           "restore` brings back.",
+                           "No database was made.");
             DaemonControl().stop();
             beginNewDatabase({});
-            context.say("A new contact database was made. Import a backup with `rolvane import`, and publish and "
+            context.say("A new contact database was made. Import contacts with `rolvane import`, and publish and "
                         "subscribe anew.");
         });
 }

@@ -8,7 +8,11 @@ namespace {
 
 const std::map<std::string, const char*>& examples() {
     static const std::map<std::string, const char*> all{
-        {"new-database", "  rolvane new-database && rolvane import backup.vcf"},
+        {"new-database", "  rolvane new-database && rolvane import contacts.vcf"},
+        {"backup", "  rolvane backup contacts.rolvane\n"
+                   "  rolvane backup --yes /media/stick/contacts.rolvane"},
+        {"restore", "  rolvane restore --dry-run contacts.rolvane\n"
+                    "  rolvane restore contacts.rolvane"},
         {"import", "  rolvane import friends.vcf work.vcf\n"
                    "  rolvane import --charset WINDOWS-1252 --dry-run old.vcf\n"
                    "  rolvane import google.csv thunderbird.ldif\n"
@@ -101,6 +105,7 @@ const std::map<std::string, const char*>& examples() {
          "  rolvane books link https://cloud.example.org/remote.php/dav/addressbooks/users/ada/contacts/ \\\n"
          "      --user ada --password-command 'pass show cloud.example.org'"},
         {"books device remove", "  rolvane books device remove phone"},
+        {"store user remove", "  rolvane store user remove bob --yes"},
         {"store user add", "  rolvane store user add alice\n"
                            "  rolvane store user add bob --invite"},
     };

@@ -28,6 +28,7 @@ const std::vector<Topic>& topics() {
          "shown without the characters that would steer a terminal.\n"},
         {"files", "Where everything lies",
          "~/.local/share/rolvane/contacts.db         the contacts, and the daemon's memory of them\n"
+         "~/.local/share/rolvane/replaced/           what `rolvane restore` has replaced\n"
          "~/.local/state/rolvane/preferences.db      preferences, and how the last pass has ended\n"
          "~/.config/rolvane/account.plist            the account on the store; never the password\n"
          "~/.config/rolvane/password                 the password, when it was asked for with --ask-password\n"

@@ -1,4 +1,6 @@
+#include "Consent.h"
 #include "Context.h"
+#include "Counted.h"
 #include "Invite.h"
 #include "Terminal.h"
 #include "ValueNames.h"
@@ -9,6 +11,7 @@
 #include "store/account/CertificateChain.h"
 
 #include <algorithm>
+#include <filesystem>
 #include <fmt/format.h>
 
 namespace rolvane::cli {
@@ -21,7 +24,7 @@ struct StoreOptions {
     std::string directory, root, authentication = "basic", user;
     int port = 0;
     bool noTLS = false, noHTTP2 = false, accessLog = false, now = false;
-    bool invite = false, renew = false, qr = false;
+    bool invite = false, renew = false, qr = false, yes = false;
 };
 
 // The store as it was started last, so that later commands need only its directory.
@@ -131,6 +134,29 @@ void addUser(Context& context, const StoreOptions& options) {
     context.say(fmt::format("{} can sign in.", options.user));
 }
 
+size_t filesBelow(const std::string& directory) {
+    size_t files = 0;
+    std::error_code error;
+    for (std::filesystem::recursive_directory_iterator each(directory, error), end; !error && each != end;
+         each.increment(error))
+        files += each->is_regular_file() && each->path().parent_path().filename() != ".DAV";
+    return files;
+}
+
+void removeUser(Context& context, const StoreOptions& options) {
+    PrivateStore store(knownOptions(options));
+    const std::vector<std::string> users = store.users();
+    const CommandError unknown(kNotFound, fmt::format("The store has no user {}.", options.user));
+    if (std::find(users.begin(), users.end(), options.user) == users.end()) throw unknown;
+    const std::string directory = store.userDirectory(options.user);
+    requireConsent(context, options.yes,
+                   fmt::format("Take the account of {} away? {} of it stay in {}, and nobody signs in as {} any more.",
+                               options.user, counted(filesBelow(directory), "file", "files"), directory, options.user),
+                   "The account stays.");
+    if (!store.removeUser(options.user)) throw unknown;
+    context.say(fmt::format("{} can no longer sign in.", options.user));
+}
+
 } // namespace
 
 void addStoreCommands(CLI::App& app, Context& context) {
@@ -186,11 +212,13 @@ void addStoreCommands(CLI::App& app, Context& context) {
             c.add_flag("--qr", o->qr, "Show the line as a QR code, too")->needs(invites);
         },
         [&context, o] { addUser(context, *o); });
-    addCommand(*user, context, "remove", "Take a user's account away; the files stay", named, [&context, o] {
-        if (!PrivateStore(knownOptions(*o)).removeUser(o->user))
-            throw CommandError(kNotFound, fmt::format("The store has no user {}.", o->user));
-        context.say(fmt::format("{} can no longer sign in.", o->user));
-    });
+    addCommand(
+        *user, context, "remove", "Take a user's account away; the files stay",
+        [named, o](CLI::App& c) {
+            named(c);
+            declareConsent(c, o->yes);
+        },
+        [&context, o] { removeUser(context, *o); });
     addCommand(*user, context, "list", "List the users", directory, [&context, o] {
         const std::vector<std::string> users = PrivateStore(knownOptions(*o)).users();
         if (context.json) return context.print(Json(users));

@@ -1,3 +1,4 @@
+#include "BackupCommands.h"
 #include "CompleteCommand.h"
 #include "Completion.h"
 #include "Context.h"
@@ -104,6 +105,7 @@ int main(int argc, char** argv) {
     addStoreCommands(app, context);
     addBooksCommands(app, context);
     addDatabaseCommands(app, context);
+    addBackupCommands(app, context);
     addSeeingCommands(app, context);
     addPlanCommand(app, context);
     addLogCommands(app, context);

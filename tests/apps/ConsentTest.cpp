@@ -160,5 +160,19 @@ TEST_F(Consent, WhatWasWithdrawnIsNotForgottenWithoutIt) {
     EXPECT_FALSE(std::filesystem::exists(file));
 }
 
+TEST_F(Consent, NobodyLosesAnAccountOnTheStoreWithoutIt) {
+    const std::string directory = world.home / "own-store";
+    world.done({"store", "start", "--directory", directory});
+    ASSERT_EQ(world.rolvane({"store", "user", "add", "carl", "--directory", directory}, "a word\n").status, kDone);
+    const std::string command = "store user remove carl --directory " + directory,
+                      question = "Take the account of carl away? 0 files";
+    expectRefused(world, {"store", "user", "remove", "carl", "--directory", directory}, question);
+    EXPECT_EQ(answered(command, "nobody signs in as carl any more.", "n"), kNotAllowed);
+    EXPECT_EQ(world.json({"store", "user", "list", "--directory", directory}).size(), 1U);
+    EXPECT_EQ(answered(command, "nobody signs in as carl any more.", "y"), kDone);
+    EXPECT_EQ(world.json({"store", "user", "list", "--directory", directory}).size(), 0U);
+    world.done({"store", "stop", "--now", "--directory", directory});
+}
+
 } // namespace
 } // namespace rolvane::test

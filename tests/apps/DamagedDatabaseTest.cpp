@@ -80,11 +80,14 @@ TEST_F(DamagedFile, ABackupInItsPlaceGoesOnWhereItWas) {
 
 TEST_F(DamagedFile, ANewDatabaseIsMadeOnPurposeAndDeletesNothingOnTheStore) {
     removeFile();
-    world.done({"new-database"});
+    const Ran unasked = world.rolvane({"new-database"}, "y\n");
+    EXPECT_TRUE(saysOnce(unasked, kNotAllowed, "Begin with 0 contacts?")) << unasked;
+    EXPECT_FALSE(std::filesystem::exists(path));
+    world.done({"new-database", "--yes"});
     EXPECT_EQ(world.json({"status"})["people"], 0);
     world.rolvane({"sync"});
     expectTheStoreIsAsItWas();
-    const Ran again = world.rolvane({"new-database"});
+    const Ran again = world.rolvane({"new-database", "--yes"});
     EXPECT_EQ(again.status, kFailure) << "there is one now\n" << again;
 }
 

@@ -26,6 +26,10 @@ Neighbour::Neighbour(CommandWorld& world, const std::string& name, const std::ve
     setAccount(account);
 }
 
+Neighbour::Neighbour(CommandWorld& world, const std::string& name, NothingYet) : user(name), _world(world) {
+    makeHome(true);
+}
+
 void Neighbour::makeHome(bool withBus) {
     for (const auto& [variable, directory] : kDirectories) {
         std::filesystem::create_directory(_home / directory);

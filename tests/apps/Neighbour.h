@@ -12,6 +12,9 @@ public:
     Neighbour(CommandWorld& world, const std::string& user, bool withBus = true);
     // On another store, where the user is known by UserWorld::kPassword: options of `rolvane account set`.
     Neighbour(CommandWorld& world, const std::string& user, const std::vector<std::string>& account);
+    // On a computer where nothing is set up.
+    struct NothingYet {};
+    Neighbour(CommandWorld& world, const std::string& user, NothingYet nothing);
     ~Neighbour();
     Neighbour(const Neighbour&) = delete;
     Neighbour& operator=(const Neighbour&) = delete;
@@ -24,6 +27,7 @@ public:
     std::unique_ptr<ChildProcess> startManager(std::vector<std::string> arguments = {});
     std::vector<std::string> environment() const; // of every program of this person
     std::string databasePath() const { return _home / "data/rolvane/contacts.db"; }
+    const std::string& homePath() const { return _home.path(); }
 
     const std::string user;
 

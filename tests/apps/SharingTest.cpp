@@ -293,7 +293,7 @@ TEST(StoreCommands, AStoreIsStartedDescribedFilledWithUsersAndStopped) {
                 "--ask-password"},
                "secret\n");
     EXPECT_EQ(world.rolvane({"account", "test"}).status, kDone);
-    world.done(with({"store", "user", "remove"}, {"alice"}));
+    world.done(with({"store", "user", "remove", "--yes"}, {"alice"}));
     EXPECT_TRUE(saysOnce(world.rolvane(with({"store", "user", "remove"}, {"alice"})), kNoSuchThing, "alice"));
     world.done(with({"store", "stop"}, {"--now"}));
     EXPECT_EQ(world.json(with({"store", "status"}), kNoSuchThing)["running"], false);

@@ -16,8 +16,9 @@ namespace {
 constexpr const char* kShareCountKey = "CXDShareCount"; // stood in the preferences in earlier versions
 
 constexpr const char* kWhatToDo =
-    "Stop RolvaneManager (`rolvane daemon stop`), move the file away and put a backup of it in its place; or save what "
-    "can be read with `rolvane export`, move the file away and begin anew with `rolvane new-database`.";
+    "Bring a backup back with `rolvane restore FILE`; or save what can be read with `rolvane export`, stop "
+    "RolvaneManager "
+    "(`rolvane daemon stop`), move the file away and begin anew with `rolvane new-database`.";
 
 std::string pathOr(const std::string& path) {
     return path.empty() ? dataDirectory() + "/contacts.db" : path;
@@ -114,10 +115,11 @@ void requireKnownDatabase(const std::string& given, const Preferences& preferenc
     if (there && !(std::filesystem::is_regular_file(path, error) && std::filesystem::file_size(path, error) == 0))
         return;
     if (there)
-        throw CXException(kCXDatabaseException,
-                          "The contact database " + path +
-                              " is empty (0 bytes): what stood in it is lost. Nothing was deleted on the store nor for "
-                              "readers. Put a backup in its place, or begin anew with `rolvane new-database`.");
+        throw CXException(
+            kCXDatabaseException,
+            "The contact database " + path +
+                " is empty (0 bytes): what stood in it is lost. Nothing was deleted on the store nor for "
+                "readers. Bring a backup back with `rolvane restore FILE`, or begin anew with `rolvane new-database`.");
     const bool wasShared =
         preferences.get(kDaemonDomain, kCXDKnownDatabase) || preferences.get(kDaemonDomain, kShareCountKey);
     if (!wasShared) return;
@@ -125,16 +127,23 @@ void requireKnownDatabase(const std::string& given, const Preferences& preferenc
         kCXDatabaseException,
         "The contact database " + path +
             " is gone, and contacts of it are shared. Nothing was deleted on the store nor for readers. Put "
-            "the file or a backup of it back, or begin anew with `rolvane new-database`.");
+            "the file back, or a backup with `rolvane restore FILE`, or begin anew with `rolvane new-database`.");
+}
+
+void requireNoDatabase(const std::string& given) {
+    const std::string path = pathOr(given);
+    std::error_code error;
+    if (!std::filesystem::exists(path, error)) return;
+    if (!std::filesystem::is_regular_file(path, error) || std::filesystem::file_size(path, error) != 0)
+        throw CXException(kCXDatabaseException,
+                          "There is a contact database in " + path + ". Move it away first if you want to begin anew.");
 }
 
 void beginNewDatabase(const std::string& given) {
     const std::string path = pathOr(given);
+    requireNoDatabase(path);
     std::error_code error;
     if (std::filesystem::exists(path, error)) {
-        if (!std::filesystem::is_regular_file(path, error) || std::filesystem::file_size(path, error) != 0)
-            throw CXException(kCXDatabaseException, "There is a contact database in " + path +
-                                                        ". Move it away first if you want to begin anew.");
         std::filesystem::rename(path, path + ".empty", error);
         if (error)
             throw CXException(kCXDatabaseException, "The empty file " + path + " could not be moved away (" +

@@ -64,6 +64,9 @@ inline constexpr const char* kCXDKnownDatabase = "CXDKnownDatabase";
 // be asked before the database is opened, which would make a new one. "": the path is the default.
 void requireKnownDatabase(const std::string& path, const Preferences& preferences);
 
+// Throws kCXDatabaseException where there is a database: a file that is not empty. "": the path is the default.
+void requireNoDatabase(const std::string& path);
+
 // Puts a new database in the place of one that is gone or empty, on purpose; an empty file is kept under another name.
 // Throws kCXDatabaseException where there is a database.
 void beginNewDatabase(const std::string& path);

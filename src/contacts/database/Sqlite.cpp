@@ -29,7 +29,7 @@ std::string explanation(int extendedCode, const std::string& detail) {
     case SQLITE_CORRUPT:
     case SQLITE_NOTADB:
         return "the file is damaged (" + detail +
-               "). It was left as it is; move it away and put a backup in its place.";
+               "). It was left as it is. `rolvane restore FILE` puts a backup in its place.";
     case SQLITE_IOERR: return "its disk reports an error (" + detail + "). Check the disk, then try again.";
     default: return detail + ". This is unexpected; please report it.";
     }
