@@ -18,6 +18,33 @@ constexpr size_t kIndexFrom = 24;               // below this a linear search is
 constexpr size_t kMostIndexed = UINT32_MAX - 2; // places have 32 bits
 constexpr size_t kAhead = 4;                    // removals whose places in the index are under way from memory
 
+// Tells two containers with the same content apart from others without a look at the content: a copy that was made by
+// deepMutableCopy has the number of its original until one of the two changes. Only of containers without others
+// inside, which change by themselves.
+class ContentMark {
+public:
+    void forget() { _number.store(0, std::memory_order_relaxed); }
+    void become(ContentMark& original) { _number.store(original.number(), std::memory_order_relaxed); }
+    bool isThatOf(const ContentMark& other) const {
+        const uint64_t own = _number.load(std::memory_order_relaxed);
+        return own != 0 && own == other._number.load(std::memory_order_relaxed);
+    }
+
+private:
+    uint64_t number() { // readers on several threads may ask for the first time at once
+        static std::atomic<uint64_t> last{0};
+        uint64_t held = _number.load(std::memory_order_relaxed);
+        if (held != 0) return held;
+        const uint64_t fresh = ++last;
+        return _number.compare_exchange_strong(held, fresh) ? fresh : held;
+    }
+    std::atomic<uint64_t> _number{0}; // 0: nothing is known
+};
+
+bool isContainer(const Value& value) {
+    return value.isArray() || value.isDictionary();
+}
+
 } // namespace
 
 // An open-addressed table from a string's hash to the places of the strings that have it. It holds no text: whoever
@@ -82,6 +109,7 @@ struct Array::Storage : SharedObject {
     std::vector<uint32_t> gaps;
     std::atomic<size_t> gapCount{0};
     std::atomic<Places*> index{nullptr};
+    ContentMark mark;
 
     ~Storage() override { delete index.load(); }
 
@@ -116,6 +144,7 @@ struct Array::Storage : SharedObject {
     void dropIndex() { delete index.exchange(nullptr); }
 
     void takeOut(const SharedText& text) {
+        mark.forget();
         indexed();
         Places& places = *index.load();
         places.eraseIf(text.hash(), [&](uint32_t place) {
@@ -154,6 +183,7 @@ struct Array::Storage : SharedObject {
 
 struct Dictionary::Storage : SharedObject {
     Map map;
+    ContentMark mark;
 };
 
 Array::Array() : _p(new Storage) {}
@@ -190,6 +220,7 @@ const Value& Array::operator[](size_t i) const {
 }
 
 void Array::append(Value v) {
+    _p->mark.forget();
     _p->items.push_back(std::move(v));
     _p->appended();
 }
@@ -207,18 +238,21 @@ void Array::insert(size_t index, Value v) {
         throw CXException(kCXRangeException,
                           fmt::format("index {} is beyond the end of an array of {}", index, count()));
     items(); // closes the gaps
+    _p->mark.forget();
     _p->dropIndex();
     _p->items.insert(_p->items.begin() + static_cast<std::ptrdiff_t>(index), std::move(v));
 }
 
 void Array::replace(size_t index, Value v) {
     (*this)[index];
+    _p->mark.forget();
     _p->dropIndex();
     _p->items[index] = std::move(v);
 }
 
 void Array::removeAt(size_t index) {
     (*this)[index];
+    _p->mark.forget();
     _p->dropIndex();
     _p->items.erase(_p->items.begin() + static_cast<std::ptrdiff_t>(index));
 }
@@ -228,6 +262,7 @@ void Array::removeAll(const Value& v) {
     const SharedText* text = wanted.textIf();
     if (text && _p->isIndexed()) return _p->takeOut(*text);
     items(); // closes the gaps
+    _p->mark.forget();
     if (std::erase(_p->items, wanted) != 0) _p->dropIndex();
 }
 
@@ -235,6 +270,7 @@ void Array::removeAllOf(const Array& others) {
     if (others.empty()) return;
     const Array gone = others.isSame(*this) ? others.mutableCopy() : others;
     items(); // closes the gaps
+    _p->mark.forget();
     if (std::erase_if(_p->items, [&](const Value& v) { return gone.contains(v); }) != 0) _p->dropIndex();
 }
 
@@ -262,11 +298,13 @@ std::optional<size_t> Array::indexOf(const Value& v) const {
 }
 
 Array Array::mutableCopy() const {
-    return Array(items());
+    Array copy(items());
+    if (std::none_of(_p->items.begin(), _p->items.end(), isContainer)) copy._p->mark.become(_p->mark);
+    return copy;
 }
 
 bool operator==(const Array& a, const Array& b) {
-    return a._p == b._p || a.items() == b.items();
+    return a._p == b._p || a._p->mark.isThatOf(b._p->mark) || a.items() == b.items();
 }
 
 Dictionary::Dictionary() : _p(new Storage) {}
@@ -300,6 +338,7 @@ void Dictionary::set(std::string_view key, Value v) {
     if (v.isAbsent())
         throw CXException(kCXInvalidArgumentException,
                           fmt::format("an absent value cannot be stored in a dictionary (key \"{}\")", key));
+    _p->mark.forget();
     if (auto it = _p->map.find(key); it != _p->map.end())
         it->second = std::move(v);
     else
@@ -310,12 +349,14 @@ bool Dictionary::setIfNew(std::string&& key, Value v) {
     if (v.isAbsent())
         throw CXException(kCXInvalidArgumentException,
                           fmt::format("an absent value cannot be stored in a dictionary (key \"{}\")", key));
+    _p->mark.forget();
     const size_t before = _p->map.size();
     _p->map.try_emplace(_p->map.end(), std::move(key), std::move(v)); // the hint makes ascending keys cheap
     return _p->map.size() != before;
 }
 
 void Dictionary::remove(std::string_view key) {
+    _p->mark.forget();
     if (auto it = _p->map.find(key); it != _p->map.end()) _p->map.erase(it);
 }
 
@@ -348,11 +389,13 @@ Array Dictionary::arrayFor(std::string_view key) {
 Dictionary Dictionary::mutableCopy() const {
     Dictionary copy;
     copy._p->map = _p->map;
+    if (std::none_of(begin(), end(), [](const auto& entry) { return isContainer(entry.second); }))
+        copy._p->mark.become(_p->mark);
     return copy;
 }
 
 bool operator==(const Dictionary& a, const Dictionary& b) {
-    return a._p == b._p || a._p->map == b._p->map;
+    return a._p == b._p || a._p->mark.isThatOf(b._p->mark) || a._p->map == b._p->map;
 }
 
 bool Value::boolean(bool otherwise) const {
@@ -420,12 +463,15 @@ Dictionary Value::dictionary() const {
 
 Value Value::deepMutableCopy() const {
     if (const Array* a = arrayIf()) {
+        if (std::none_of(a->begin(), a->end(), isContainer)) return a->mutableCopy();
         std::vector<Value> items;
         items.reserve(a->count());
         for (const Value& v : *a) items.push_back(v.deepMutableCopy());
         return Array(std::move(items));
     }
     if (const Dictionary* d = dictionaryIf()) {
+        if (std::none_of(d->begin(), d->end(), [](const auto& entry) { return isContainer(entry.second); }))
+            return d->mutableCopy();
         Dictionary copy;
         for (const auto& [key, value] : *d) copy.set(key, value.deepMutableCopy());
         return copy;

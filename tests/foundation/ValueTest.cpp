@@ -1,4 +1,5 @@
 #include "foundation/Value.h"
+#include "foundation/PropertyList.h"
 #include "foundation/StrongString.h"
 
 #include "Generators.h"
@@ -221,6 +222,44 @@ TEST(ValueTest, ADeepCopySharesNoContainer) {
     EXPECT_EQ(copy, v);
     copy.dictionary()["list"].array()[0].dictionary().set("x", 2);
     EXPECT_EQ(v, Value(Dictionary{{"list", Array{Dictionary{{"x", 1}}}}}));
+}
+
+// A copy that has not changed is known to be equal without a look at its elements; nothing may look unchanged that is.
+RC_GTEST_PROP(ValueTest, CopiesAreEqualForAsLongAsTheirElementsAre, ()) {
+    std::vector<Array> arrays{strings(0, *rc::gen::inRange(0, 40))};
+    std::vector<Dictionary> dictionaries{Dictionary{{"a", 1}, {"b", "x"}}};
+    const auto steps = *rc::gen::container<std::vector<int>>(rc::gen::inRange(0, 14));
+    for (const int step : steps) {
+        Array& array = arrays[*rc::gen::inRange<size_t>(0, arrays.size())];
+        Dictionary& dictionary = dictionaries[*rc::gen::inRange<size_t>(0, dictionaries.size())];
+        const size_t at = array.empty() ? 0 : *rc::gen::inRange<size_t>(0, array.count());
+        const std::string text = "s" + std::to_string(*rc::gen::inRange(0, 4));
+        switch (step) {
+        case 0: array.append(text); break;
+        case 1: array.insert(at, text); break;
+        case 2:
+            if (!array.empty()) array.replace(at, text);
+            break;
+        case 3:
+            if (!array.empty()) array.removeAt(at);
+            break;
+        case 4: array.removeAll(text); break;
+        case 5: array.removeAllOf(Array{text, "s9"}); break;
+        case 6: array.append(Array{text}); break;
+        case 7: dictionary.set(text, 1); break;
+        case 8: dictionary.remove(text); break;
+        case 9: dictionary.setIfNew(std::string(text), 2); break;
+        case 10: dictionary.arrayFor("list").append(text); break;
+        case 11: dictionary.addEntriesFrom(dictionaries.front()); break;
+        case 12: arrays.push_back(Value(array).deepMutableCopy().array()); break;
+        default: dictionaries.push_back(Value(dictionary).deepMutableCopy().dictionary()); break;
+        }
+        const auto bytesOf = [](const Value& v) { return BinaryValue::encode(v); };
+        for (const Array& a : arrays)
+            for (const Array& b : arrays) RC_ASSERT((a == b) == (bytesOf(a) == bytesOf(b)));
+        for (const Dictionary& a : dictionaries)
+            for (const Dictionary& b : dictionaries) RC_ASSERT((a == b) == (bytesOf(a) == bytesOf(b)));
+    }
 }
 
 TEST(ValueTest, IntegersAndRealsAreEqualWhenTheirNumbersAreExactly) {

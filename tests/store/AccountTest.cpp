@@ -288,6 +288,100 @@ TEST(VersionMemory, GoesBackToWhatWasSavedLast) {
     EXPECT_FALSE(m.knows("not saved", v));
 }
 
+TEST(VersionMemory, ASaveWritesWhatHasChangedAndNotTheWhole) {
+    TempDirectory directory;
+    const auto version = [](int i) { return FileVersion{EntityTag("\"" + std::to_string(i) + "\""), {}, 5}; };
+    VersionMemory m(directory / "v");
+    for (int i = 0; i < 10000; ++i) m.read(std::to_string(i), version(i));
+    m.save({7, 1});
+    const auto whole = std::filesystem::file_size(directory / "v");
+    for (int pass = 2; pass < 100; ++pass) {
+        m.read("edited", version(pass));
+        if (pass == 50) m.forget("17");
+        m.save({7, pass});
+    }
+    EXPECT_LT(std::filesystem::file_size(directory / "v") - whole, 100u * 3 * 32);
+    VersionMemory again(directory / "v");
+    again.belongTo({7, 99});
+    EXPECT_TRUE(again.knows("edited", version(99)));
+    EXPECT_FALSE(again.knows("edited", version(98)));
+    EXPECT_FALSE(again.remembers("17"));
+    EXPECT_EQ(again.count(), 10000u);
+}
+
+TEST(VersionMemory, TheFileOfManyChangesStaysSmall) {
+    TempDirectory directory;
+    VersionMemory m(directory / "v");
+    for (uint64_t pass = 1; pass < 5000; ++pass) {
+        m.read("edited", {EntityTag("\"" + std::to_string(pass) + "\""), {}, 5});
+        m.save({7, pass});
+    }
+    EXPECT_LT(std::filesystem::file_size(directory / "v"), 70u << 10);
+    EXPECT_TRUE(VersionMemory(directory / "v").knows("edited", {EntityTag("\"4999\""), {}, 5}));
+}
+
+TEST(VersionMemory, ASaveThatIsNotThereToItsEndHasNotBeen) {
+    TempDirectory directory;
+    const FileVersion one{EntityTag("\"1\""), {}, 5}, two{EntityTag("\"2\""), {}, 5};
+    {
+        VersionMemory m(directory / "v");
+        m.read("u", one);
+        m.save({7, 1});
+        m.read("u", two);
+        m.read("w", two);
+        m.save({7, 2});
+    }
+    const auto whole = std::filesystem::file_size(directory / "v");
+    const std::string text = readFile(directory / "v");
+    for (uintmax_t size = whole - 1; size > whole - 3 * 32; --size) {
+        writeFileDurably(directory / "v", text.substr(0, size));
+        VersionMemory m(directory / "v");
+        EXPECT_TRUE(m.knows("u", one)) << size;
+        EXPECT_FALSE(m.remembers("w")) << size;
+        m.read("x", one); // and what follows is saved
+        m.save({7, 3});
+        EXPECT_TRUE(VersionMemory(directory / "v").knows("x", one)) << size;
+        EXPECT_TRUE(VersionMemory(directory / "v").knows("u", one)) << size;
+    }
+    std::string damaged = text;
+    damaged[whole - 40] ^= 1;
+    writeFileDurably(directory / "v", damaged);
+    EXPECT_TRUE(VersionMemory(directory / "v").knows("u", one));
+}
+
+TEST(VersionMemory, TwoProcessesDoNotWriteIntoEachOthersSaves) {
+    TempDirectory directory;
+    const FileVersion v{EntityTag("\"1\""), {}, 5};
+    VersionMemory a(directory / "v"), b(directory / "v");
+    a.read("a", v);
+    a.save({7, 1});
+    b.read("b", v);
+    b.save({7, 2});
+    a.read("c", v);
+    a.save({7, 3});
+    VersionMemory now(directory / "v");
+    EXPECT_TRUE(now.knows("a", v) && now.knows("c", v)) << "the last one's memory stands";
+}
+
+TEST(VersionMemory, WhatIsOfAnotherStateOfTheDatabaseDoesNotComeBackWithALaterOne) {
+    TempDirectory directory;
+    const FileVersion v{EntityTag("\"1\""), {}, 5};
+    {
+        VersionMemory m(directory / "v");
+        m.read("u", v);
+        m.save({7, 3});
+    }
+    {
+        VersionMemory m(directory / "v");
+        m.belongTo({7, 2}); // a backup was put back
+        EXPECT_FALSE(m.knows("u", v));
+        m.save({7, 3});
+    }
+    VersionMemory m(directory / "v");
+    m.belongTo({7, 4});
+    EXPECT_FALSE(m.knows("u", v));
+}
+
 TEST(VersionMemory, AWriteWithoutATagIsKnownBySizeAndServerDate) {
     VersionMemory m;
     m.wrote("u", EntityTag(), Date(1000), "hello");

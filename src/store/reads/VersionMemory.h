@@ -9,6 +9,7 @@
 #include <string>
 #include <string_view>
 #include <unordered_map>
+#include <unordered_set>
 
 namespace rolvane {
 
@@ -21,8 +22,11 @@ struct FileVersion {
 
 // Remembers, per URL, the version of each remote file that this client last read or wrote. A cache: a forgotten version
 // costs a read. Bounded: past `capacity` URLs it forgets some. Weak and strong forms of one entity tag are one version.
-// Any thread.
-//   file = "RVM3" owner:u64 passes:u64 seed:u64 (urlHash:u64 kind:u64 value:u64 digest:u64)*   as the machine has it
+// Any thread. The file is a log that is read with the first use; a save adds what has changed since the one before, and
+// writes the whole anew where most of the file is out of date. A save that is not there to its end has not been.
+//   file = "RVM4" seed:u64 save*   save = row* end   row = urlHash:u64 kind:u64 value:u64 digest:u64   kind 0:
+//   forgotten end = identity:u64 4:u64 passes:u64 sum:u64   of the rows of the save and this one. Numbers as the
+//   machine has them.
 class VersionMemory {
 public:
     // Whose memory it is: what was read counts for the database that has it. One of an earlier state, a backup that was
@@ -43,13 +47,15 @@ public:
     // True when the version in a listing is the one remembered.
     bool knows(std::string_view url, const FileVersion& version);
 
-    bool remembers(std::string_view url) const; // some version of it
+    bool remembers(std::string_view url); // some version of it
 
     // Forgets everything, unless it was saved for this database, in this state or an earlier one.
     void belongTo(const Owner& owner);
     void save(const Owner& owner); // nothing when unchanged; a failure is logged
     void revert();                 // to what was saved last
-    size_t count() const;
+    size_t count();
+    // So often something has become known or was forgotten in this process, clock files left out.
+    uint64_t changes();
 
 private:
     enum class Kind : uint64_t { tag = 1, dated = 2, written = 3 };
@@ -57,19 +63,33 @@ private:
         Kind kind;
         uint64_t value;
         uint64_t digest = 0; // of a written version: hash of the tag that would be its digest
+        bool operator==(const Entry&) const = default;
     };
+    // With the lock held, as all of the following.
+    void need(); // the file is read
+    void load();
+    void takeRows(const std::string& text);
+    void judge(const Owner& owner);
+    void put(std::string_view url, Entry entry);
+    void erase(std::string_view url);
     uint64_t hash(std::string_view text) const;
     uint64_t tagHash(const EntityTag& tag) const;
-    void put(std::string_view url, Entry entry);
-    void load();
+    std::string rows(bool all) const;
+    bool append(const std::string& rows);
+    void replace(const std::string& rows);
 
     const std::string _path;
     const size_t _capacity;
     mutable std::mutex _mutex; // guards the following
-    uint64_t _seed;
-    Owner _owner;
+    bool _isRead = false;
+    bool _isForeign = false; // the file is of another database, or of a later state of this one
+    uint64_t _seed = 0;
+    Owner _owner;                // as saved last
+    std::optional<Owner> _judge; // whose it has to be, before it is read
     std::unordered_map<uint64_t, Entry> _entries;
-    bool _changed = false;
+    std::unordered_set<uint64_t> _unsaved; // hashes of URLs
+    uint64_t _changes = 0;
+    uint64_t _fileNumber = 0, _fileSize = 0; // of the file as it was read or written last; 0: of none
 };
 
 } // namespace rolvane
