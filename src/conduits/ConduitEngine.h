@@ -20,6 +20,9 @@ public:
     // The mutable dictionary under the key inside the conduit's data, made empty at either level when absent.
     virtual Dictionary conduitObjectForKey(const std::string& conduitID, const std::string& key) = 0;
     virtual void setConduitObjectForKey(const std::string& conduitID, const Value& object, const std::string& key) = 0;
+    // The number of the state that all of that is in: an equal one says that nothing has changed since, but for the
+    // dates of trees. None where nobody keeps count. Main thread.
+    virtual std::optional<uint64_t> stateGeneration() { return std::nullopt; }
     virtual void syncPrefs() = 0;
     // Saves the contact database while more changes of the pass are to come, together with what the engine remembers of
     // those before: when the change that is being applied is done. Main thread.

@@ -304,6 +304,9 @@ Dictionary CXDSyncEngine::knownGroupState(const std::string& conduitID, const Us
 void CXDSyncEngine::saveInThePass() {
     _parts->saveInThePass = true;
 }
+std::optional<uint64_t> CXDSyncEngine::stateGeneration() {
+    return _parts->state.generation();
+}
 void CXDSyncEngine::syncPrefs() {
     _parts->state.syncPrefs();
 }

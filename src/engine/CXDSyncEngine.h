@@ -61,6 +61,7 @@ public:
     Dictionary conduitObjectForKey(const std::string& conduitID, const std::string& key) override;
     void setConduitObjectForKey(const std::string& conduitID, const Value& object, const std::string& key) override;
     Dictionary knownGroupState(const std::string& conduitID, const UserName& user, const UniqueId& group) override;
+    std::optional<uint64_t> stateGeneration() override;
     void syncPrefs() override;
     void saveInThePass() override;
     CXDChangeRecords getPendingChanges() const;

@@ -78,12 +78,11 @@ TEST_F(Subscribing, TheFirstPassAsksForEverythingOnceAndForContactsBeforeItHasRe
     std::vector<std::string> begun;
     answerBob([&](const HttpRequest& request) {
         const std::lock_guard guard(lock);
-        // The tree and its folder are begun before it is known that the store tells changes, and listed again then.
-        const std::string path = request.url.path();
-        const bool mayComeTwice =
-            request.method == "PROPFIND" && (path.ends_with("/Contacts/") || path.ends_with("/People/"));
-        if (!mayComeTwice && path.find("/alice/") != std::string::npos)
-            begun.push_back(request.method + " " + request.url.path());
+        const auto depth = std::find_if(request.headers.begin(), request.headers.end(),
+                                        [](const auto& header) { return header.first == "Depth"; });
+        if (request.url.path().find("/alice/") != std::string::npos)
+            begun.push_back(request.method + " " + request.url.path() +
+                            (depth == request.headers.end() ? "" : " Depth " + depth->second));
         return std::nullopt;
     });
     bob.pass();

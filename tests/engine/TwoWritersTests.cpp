@@ -226,7 +226,8 @@ TEST_F(TwoWriters, AnEditThatGoesOutWithoutALookAtTheTreeDoesNotBringADeletedCon
         second.application->save();
         std::atomic<bool> fails = true;
         second.wire->intercept([&](const HttpRequest& request) {
-            return fails && request.method == "PROPFIND" ? std::optional(answerOf(503)) : std::nullopt;
+            return fails && (request.method == "PROPFIND" || request.method == "REPORT") ? std::optional(answerOf(503))
+                                                                                         : std::nullopt;
         });
         second.pass();
         EXPECT_FALSE(std::filesystem::exists(fileOf(gone))) << log.text();
@@ -359,7 +360,8 @@ TEST_F(TwoWriters, WhatIsChangedAfterAPassOnAFullDiskIsNotTakenBackByWhatThatPas
     alice.application->save();
     alice.wire->clear();
     alice.wire->intercept([](const HttpRequest& request) -> std::optional<HttpResponse> {
-        if (request.method == "PROPFIND") interceptWrites([] { return false; }); // no room from here on
+        const bool isOfTheTree = request.method == "PROPFIND" || request.method == "REPORT";
+        if (isOfTheTree) interceptWrites([] { return false; }); // no room from here on
         return std::nullopt;
     });
     try {

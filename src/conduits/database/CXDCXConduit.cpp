@@ -100,6 +100,9 @@ CXDChangeRecords CXDCXConduit::changeRecords() {
     const CXRolvane::OneMoment moment(rolvane());
     const Scan scan{rolvane().journalPosition(), since};
     const Date ownSince = everything ? Date::distantPast() : since;
+    const auto states = engine().stateGeneration();
+    const auto now = states ? std::optional(Moment{scan.journalPosition, *states}) : std::nullopt;
+    const bool isAsBefore = now && !everything && now == _foundNothing;
 
     ChangeCapture capture = newCapture();
     capture.reader().expectMany();
@@ -126,14 +129,21 @@ CXDChangeRecords CXDCXConduit::changeRecords() {
         const auto person = rolvane().personRow(edited);
         if (person && (person->modified <= since || person->writer == ownProgram())) capture.addPerson(*person, true);
     }
+    if (!isAsBefore) addAllGroups(capture);
+
+    _scan = scan;
+    _editsKnown = scan.journalPosition;
+    CXDChangeRecords records = capture.take();
+    _foundNothing = records.empty() ? now : std::nullopt;
+    return records;
+}
+
+// Each takes as long as it has members.
+void CXDCXConduit::addAllGroups(ChangeCapture& capture) {
     for (const CXSubscriptionRef& subscription : rolvane().subscriptions())
         if (subscription->_isAll() && saysSomething(*subscription))
             capture.addGroup(rolvane().allGroupForRemoteLocation(subscription->remoteLocation()));
     capture.addGroup(rolvane().allGroup());
-
-    _scan = scan;
-    _editsKnown = scan.journalPosition;
-    return capture.take();
 }
 
 // The owner's tree has lost what it held: nothing of it counts as known any more, so that all of it is new.

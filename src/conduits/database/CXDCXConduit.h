@@ -131,10 +131,18 @@ private:
         Date since;
     };
 
+    // All that a scan of the all-contacts groups looks at; equal ones find the same.
+    struct Moment {
+        int64_t journal = 0;
+        uint64_t states = 0;
+        bool operator==(const Moment&) const = default;
+    };
+
     Dictionary priorState() const;
     ChangeCapture newCapture() const;
     bool forgetWhatIsPublishedAgain(); // true: there is something
     bool saysSomething(const CXSubscription& subscription) const;
+    void addAllGroups(ChangeCapture& capture);
     void addUnsettledGroups(ChangeCapture& capture);
     void addUnsettledPeople(ChangeCapture& capture);
     const std::string& ownProgram() const;
@@ -157,6 +165,7 @@ private:
     World _world;
     bool _readOnlyKillSwitch = false;
     std::optional<Scan> _scan;
+    std::optional<Moment> _foundNothing;      // of the last scan, if so
     int64_t _lastScan = 0;                    // the journal's position at the scan of the pass before, in this process
     int64_t _captured = 0;                    // the journal's position when this pass gathered, and
     int64_t _editsKnown = 0;                  // the one up to which

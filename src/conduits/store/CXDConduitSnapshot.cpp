@@ -117,6 +117,7 @@ std::vector<RemoteLocation> CXDConduit::locationsToRead() {
 
 Dictionary CXDConduit::currentState() {
     Dictionary state;
+    _unchanged.clear();
     if (!conduitID() || conduitSource() == 0) return state; // no source of its own
     for (const RemoteLocation& location : locationsToRead()) readLocation(location, state);
     return state;
@@ -124,9 +125,14 @@ Dictionary CXDConduit::currentState() {
 
 void CXDConduit::readLocation(const RemoteLocation& location, Dictionary& state) {
     const UserName user = _engine.userForRemoteLocation(location);
-    if (user.empty() || state.contains(user.str())) return; // a location that names nobody cannot be read
+    // A location that names nobody cannot be read.
+    if (user.empty() || state.contains(user.str()) || _unchanged.contains(user)) return;
     const auto base = baseLocationForUser(realUserFromUser(user));
     if (!base) return;
+    if (isUnchanged(user, *base)) {
+        _unchanged.insert(user);
+        return _engine.treeWasLookedAt(user, TreeLook::read);
+    }
     bool forbidden = true;
     const bool isNew = !_engine.conduitObjectForKey(*conduitID(), kPriorState).contains(user.str());
     const auto userState = fetchWorkingState(*base, &forbidden, isNew && user != kSelf);
@@ -261,6 +267,11 @@ CXDChangeRecords CXDConduit::comparePriorStateToCurrentState(const Dictionary& p
 
 void CXDConduit::compareUser(const UserName& user, const Dictionary& prior, const Dictionary& current,
                              CXDChangeRecords& records) {
+    if (_unchanged.contains(user)) {
+        const auto lists = changeRecordsForACLAtRemoteLocation(*baseLocationForUser(user));
+        records.insert(records.end(), lists.begin(), lists.end());
+        return;
+    }
     const Dictionary now = current[user.str()].dictionary();
     const Value& serial = now[kSerialNumber];
     const auto base = baseLocationForUser(user); // of the user as it stands, "<self>" included

@@ -84,15 +84,18 @@ void CXDVaultraConduit::beginReading() {
         const UserName user = engine().userForRemoteLocation(location);
         const auto base = user.empty() || user == kSelf ? std::nullopt : baseLocationForUser(user);
         if (!base) continue;
-        _world.manager.expectSomeReads({base->cxURLByAppendingComponent(layout::kInfo)}, false);
+        if (!_foundNothing.contains(user)) // else it is read when the tree has changed
+            _world.manager.expectSomeReads({base->cxURLByAppendingComponent(layout::kInfo)}, false);
         _world.manager.expectListing(*base);
         return; // a wrong password is not to be offered many times
     }
 }
 
-// A gathering reads a tree that the prior state has, and finds it whole then.
+// A gathering reads a tree that the prior state has, and finds it whole then. A tree that was whole before is taken for
+// it: reading it, the lock and the writes meet what is missing.
 void CXDVaultraConduit::lookAfterStructure(bool meanwhile) {
     awaitStructure();
+    if (_world.manager.knowsPublishStructure()) return;
     if (!meanwhile) {
         sanityCheckPublishStructure();
         return;
@@ -120,6 +123,7 @@ void CXDVaultraConduit::open() {
     _world.manager.useVersionMemoryOf(database().databaseIdentity(), database().shareCount());
     _writes.giveUpMerged(); // of a pass that failed
     _setBack.clear();
+    _compared.clear(); // of a pass that failed
     _isOlderCopy = engine().conduitObjectForKey(kConduitCX, kPublishAgain)[kOlderCopy].boolean();
     const int code = testReachability(gathering ? [this] { beginReading(); } : std::function<void()>());
     if (code == kCXDAVErrorAuthentication) {

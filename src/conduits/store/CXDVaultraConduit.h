@@ -3,6 +3,7 @@
 #include "conduits/CXDConduit.h"
 #include "conduits/database/ContactWrites.h"
 #include "foundation/Notification.h"
+#include "store/dav/CXDAVManager.h"
 
 #include <atomic>
 #include <functional>
@@ -18,7 +19,6 @@ namespace rolvane {
 
 struct TreeCondition;
 
-class CXDAVManager;
 class CXNetworkController;
 class CXRolvane;
 class Clock;
@@ -120,8 +120,18 @@ protected:
     // A tree that was set back or has lost its lists says nothing about anybody's contacts, and is left alone. The
     // owner's own is published again.
     bool isTrusted(const UserName& user, const Dictionary& state) override;
+    bool isUnchanged(const UserName& user, const Url& base) override;
 
 private:
+    // All that a comparison of a tree with what is known of it looks at; equal ones find the same.
+    struct Comparison {
+        int64_t journal = 0;
+        uint64_t states = 0;
+        CXDAVManager::TreeMark tree;
+        bool operator==(const Comparison&) const = default;
+    };
+    std::optional<Comparison> comparisonWith(const UserName& user, const Url& base, bool ask);
+    void noteWithoutChanges(int64_t journal, const std::set<UserName>& changed);
     void beginReading();
     void lookAfterStructure(bool meanwhile); // while the pass goes on
     void awaitStructure();                   // any thread
@@ -167,6 +177,8 @@ private:
     std::set<UserName> _setBack;                  // other trees that are, as this pass has seen; main thread
     CXDChangeRecords _leftovers;                  // of the gathering that is under way
     std::map<UserName, Dictionary> _read;         // so far: the states of known users
+    std::map<UserName, Comparison> _foundNothing; // the last comparisons that found nothing
+    std::map<UserName, Comparison> _compared;     // those of the gathering that is under way
     bool _gathering = false;                      // `open` belongs to a gathering
     std::mutex _structureLock;
     std::future<void> _structure; // the look at the own tree that is under way; guarded by _structureLock

@@ -64,6 +64,42 @@ bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state)
     return false;
 }
 
+// None where nobody can tell, or something is to be done to the tree whatever lies there.
+std::optional<CXDVaultraConduit::Comparison> CXDVaultraConduit::comparisonWith(const UserName& user, const Url& base,
+                                                                               bool ask) {
+    const auto states = engine().stateGeneration();
+    if (!states || (user == kSelf && !engine().conduitObjectForKey(kConduitCX, kPublishAgain).empty()))
+        return std::nullopt;
+    const auto tree = _world.manager.markOfTree(base, ask);
+    return tree ? std::optional(Comparison{_world.rolvane.journalPosition(), *states, *tree}) : std::nullopt;
+}
+
+bool CXDVaultraConduit::isUnchanged(const UserName& user, const Url& base) {
+    const auto before = _foundNothing.find(user);
+    if (before == _foundNothing.end() || comparisonWith(user, base, true) != before->second) return false;
+    const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
+    Dictionary prior = users[user.str()].dictionary();
+    Dictionary dates;
+    for (const auto& [file, date] : _world.manager.datesOfTree(base)) dates.set(file, date);
+    if (!treeCondition({{kTreeDates, prior[kTreeDates].dictionary()}}, {{kTreeDates, dates}},
+                       user == kSelf ? _lastSyncDate : std::nullopt)
+             .isSound())
+        return false;
+    prior.set(kTreeDates, dates);
+    _compared.insert(*before);
+    return true;
+}
+
+// `journal`: as it was when the trees were read; `changed`: for whom there is anything to be done.
+void CXDVaultraConduit::noteWithoutChanges(int64_t journal, const std::set<UserName>& changed) {
+    for (const auto& [user, state] : _read)
+        if (!changed.contains(user))
+            if (const auto base = baseLocationForUser(realUserFromUser(user)))
+                if (const auto compared = comparisonWith(user, *base, false))
+                    _compared.emplace(user, Comparison{journal, compared->states, compared->tree});
+    _foundNothing = std::exchange(_compared, {});
+}
+
 // Single files that are too many or too few: another writer has deleted what somebody else was about to write, or the
 // store has lost them.
 void CXDVaultraConduit::mendOwnTree(const Dictionary& prior, const Dictionary& state) {
@@ -125,12 +161,20 @@ bool CXDVaultraConduit::allGroupHas(const char* property) {
 }
 
 CXDChangeRecords CXDVaultraConduit::changeRecords() {
+    const int64_t journal = _world.rolvane.journalPosition(); // of before: what is saved meanwhile counts as unseen
     CXDChangeRecords records = CXDConduit::changeRecords();
     if (_world.rolvane.allGroup()->valueForProperty(kCXRemoteLocationProperty) && endedPublication(_world.preferences))
         _world.preferences.remove(kDaemonDomain, kCXDEndedPublication); // published again since
     _isOlderCopy = engine().conduitObjectForKey(kConduitCX, kPublishAgain)[kOlderCopy].boolean();
+    std::set<UserName> changed;
+    for (const CXDChangeRecordPtr& record : records)
+        if (record->user()) changed.insert(*record->user());
     leaveUnlistedOut(records);
     compareUnlistedGroups(records);
+    for (const CXDChangeRecords* some : {&records, &_leftovers})
+        for (const CXDChangeRecordPtr& record : *some)
+            if (record->user()) changed.insert(*record->user());
+    noteWithoutChanges(journal, changed);
     _read.clear();
     records.insert(records.end(), _leftovers.begin(), _leftovers.end());
     _leftovers.clear();

@@ -14,7 +14,8 @@ namespace rolvane {
 namespace {
 
 constexpr std::string_view kStates = "CXDConduitData"; // and "CXDConduitData/..."
-constexpr std::array<std::string_view, 8> kOthers{
+constexpr std::array<std::string_view, 9> kOthers{
+    "CXDStateEdition",
     "CXDPendingChanges",
     "CXDVaultraConduitLastSyncDate",
     "CXDCXConduitLastSyncDate",

@@ -4,6 +4,7 @@
 #include "foundation/CXException.h"
 #include "foundation/KeyedArchive.h"
 #include "foundation/Log.h"
+#include "foundation/Paths.h"
 #include "model/PayloadKeys.h"
 #include "model/RemoteLocationMap.h"
 
@@ -17,10 +18,24 @@ namespace rolvane {
 namespace {
 constexpr const char* kSubscriptionMap = "subscriptionMap";
 constexpr const char* kRecordClass = "CXDChangeRecord";
+
+// The dates of a tree's own files, which every pass of its owner moves.
+bool isOfDatesAlone(const std::string& row) {
+    return row.ends_with("/TreeDates");
+}
 } // namespace
 
+// Whether another process, or a change in memory that was never put, makes it worth to be read.
+bool EngineState::isAsStored() {
+    return !_putAll && _edition && _preferences.get(kDaemonDomain, kCXDStateEdition) == _edition &&
+           stateRows(*_conduitData) == _stored;
+}
+
 Dictionary EngineState::loadedConduitData() {
+    if (std::exchange(_isDropped, false) && _conduitData && !isAsStored()) _conduitData.reset();
     if (!_conduitData) {
+        ++_generation;
+        _edition = _preferences.get(kDaemonDomain, kCXDStateEdition);
         _stored.clear();
         for (const std::string& key : _preferences.keys(kDaemonDomain))
             if (isStateRow(key)) _stored.emplace(key, _preferences.get(kDaemonDomain, key));
@@ -37,7 +52,13 @@ Dictionary EngineState::conduitData() {
 
 void EngineState::dropConduitData() {
     const std::lock_guard guard(_lock);
-    _conduitData.reset();
+    _isDropped = true;
+}
+
+uint64_t EngineState::generation() {
+    const std::lock_guard guard(_lock);
+    loadedConduitData();
+    return _generation;
 }
 
 void EngineState::withConduitData(const std::function<void(Dictionary&)>& use) {
@@ -86,9 +107,15 @@ Dictionary EngineState::marks() {
 void EngineState::forgetPut() noexcept {
     const std::lock_guard guard(_lock);
     _putAll = true;
+    ++_generation;
 }
 
 void EngineState::put(const StateRows& rows) {
+    bool isAnother = false, isOther = false;
+    const auto changes = [&](const std::string& row) {
+        isAnother = true;
+        isOther = isOther || !isOfDatesAlone(row);
+    };
     if (_putAll) {
         _stored.clear();
         for (const std::string& key : _preferences.keys(kDaemonDomain))
@@ -99,15 +126,21 @@ void EngineState::put(const StateRows& rows) {
         if (rows.contains(stored->first)) {
             ++stored;
         } else {
+            changes(stored->first);
             _preferences.remove(kDaemonDomain, stored->first);
             stored = _stored.erase(stored);
         }
     for (const auto& [key, value] : rows) {
         Value& stored = _stored[key];
         if (stored == value) continue;
+        changes(key);
         _preferences.set(kDaemonDomain, key, value);
         stored = value.deepMutableCopy();
     }
+    if (isOther) ++_generation;
+    if (!isAnother) return;
+    _edition = makeUUID();
+    _preferences.set(kDaemonDomain, kCXDStateEdition, _edition);
 }
 
 void EngineState::syncPrefs() {
@@ -263,12 +296,13 @@ void EngineState::reset() {
     CXDLog("Reset!");
     for (const char* key :
          {kCXDPendingChanges, kCXDConduitData, kCXDVaultraConduitLastSyncDate, kCXDCXConduitLastSyncDate,
-          kCXDLocalConduitLastSyncDate, kCXDShareCount, kCXDLastOstrelUser, kCXDUnderWay})
+          kCXDLocalConduitLastSyncDate, kCXDShareCount, kCXDLastOstrelUser, kCXDUnderWay, kCXDStateEdition})
         _preferences.remove(kDaemonDomain, key);
     for (const std::string& key : _preferences.keys(kDaemonDomain))
         if (isStateRow(key)) _preferences.remove(kDaemonDomain, key);
     _preferences.synchronize(kDaemonDomain);
-    dropConduitData();
+    const std::lock_guard guard(_lock);
+    _conduitData.reset();
 }
 
 } // namespace rolvane

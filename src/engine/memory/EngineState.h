@@ -18,7 +18,8 @@ namespace rolvane {
 // Keys of the daemon's domain.
 inline constexpr const char* kCXDPendingChanges = "CXDPendingChanges";
 inline constexpr const char* kCXDConduitData = "CXDConduitData";
-inline constexpr const char* kCXDUnderWay = "CXDUnderWay"; // engine/recovery/UnderWay.h
+inline constexpr const char* kCXDStateEdition = "CXDStateEdition"; // another one with each change of the conduit data
+inline constexpr const char* kCXDUnderWay = "CXDUnderWay";         // engine/recovery/UnderWay.h
 inline constexpr const char* kCXDVaultraConduitLastSyncDate = "CXDVaultraConduitLastSyncDate";
 inline constexpr const char* kCXDCXConduitLastSyncDate = "CXDCXConduitLastSyncDate";
 inline constexpr const char* kCXDLocalConduitLastSyncDate = "CXDLocalConduitLastSyncDate";
@@ -42,7 +43,11 @@ public:
     explicit EngineState(Preferences& preferences) : _preferences(preferences) {}
 
     Dictionary conduitData();
-    void dropConduitData(); // the next use reads it again
+    // The next use reads it again. What is in memory stays where it is just what is stored: reading takes as long as
+    // there are people.
+    void dropConduitData();
+    // Another number whenever something of it was put that differs, but for the dates of trees, or read from elsewhere.
+    uint64_t generation();
     void withConduitData(const std::function<void(Dictionary&)>& use);
     Dictionary conduitObjectForKey(const std::string& conduitID, const std::string& key); // made empty when absent
     void setConduitObjectForKey(const std::string& conduitID, const Value& object, const std::string& key);
@@ -90,14 +95,18 @@ public:
     Preferences& preferences() const { return _preferences; }
 
 private:
-    Dictionary loadedConduitData(); // with _lock held
+    Dictionary loadedConduitData(); // with _lock held, as the next two
+    bool isAsStored();
     void put(const StateRows& rows);
 
     Preferences& _preferences;
     std::mutex _lock;
-    std::optional<Dictionary> _conduitData; // guarded by _lock, as are the next three
+    std::optional<Dictionary> _conduitData; // guarded by _lock, as are the following
     StateRows _stored;                      // as the preferences have them, set or synchronised
     bool _putAll = false;                   // they may have others
+    bool _isDropped = false;                // to be read again, unless nothing has changed
+    Value _edition;                         // of _stored
+    uint64_t _generation = 0;
     std::vector<Refusal> _refused;
 };
 

@@ -277,6 +277,30 @@ void CXDAVManager::keepSerialNumber(const std::string& serial) {
 bool CXDAVManager::sanityCheckPublishStructureCreate(bool create) {
     return !account().user.empty() && _impl->structure.check(create);
 }
+std::optional<CXDAVManager::TreeMark> CXDAVManager::markOfTree(const Url& tree, bool ask) {
+    if (ask) {
+        StoreListing::AskedRef begun = _impl->begun(tree);
+        if (!StoreListing(_impl->session, _impl->versions, _impl->listings).bringUpToDate(tree, begun))
+            return std::nullopt;
+        const std::lock_guard guard(_impl->begunLock);
+        _impl->begunListings.insert_or_assign(tree.absoluteString(), std::move(begun));
+    }
+    const uint64_t listing = _impl->listings.stateOf(tree);
+    return listing == 0 ? std::nullopt : std::optional(TreeMark{listing, _impl->versions.changes()});
+}
+
+std::map<std::string, Date> CXDAVManager::datesOfTree(const Url& tree) {
+    std::map<std::string, Date> dates;
+    _impl->listings.forEach(tree, ListingMemory::kSynced, [&](const ListingMemory::Member& member) {
+        if ((member.encodedName == "info" || member.encodedName == "dateFile") && member.entry.lastModified)
+            dates.emplace(member.encodedName, *member.entry.lastModified);
+    });
+    return dates;
+}
+
+bool CXDAVManager::knowsPublishStructure() const {
+    return _impl->structure.isKnown();
+}
 
 std::optional<bool> CXDAVManager::keepsAccessLists() {
     return _impl->session.keepsAccessLists();

@@ -135,6 +135,19 @@ public:
     // One request when all is there. With `create` what is missing is made; nothing that exists is written again.
     // True when the structure is complete afterwards.
     bool sanityCheckPublishStructureCreate(bool create);
+    // What is known of a tree by listing it: equal numbers say that neither the store nor this client's knowledge of
+    // its versions has changed, but for the clock file. Only in this process.
+    struct TreeMark {
+        uint64_t listing = 0, versions = 0;
+        bool operator==(const TreeMark&) const = default;
+    };
+    // `ask`: the store is asked what has changed; the next listing of the tree in this pass is then made of that. None
+    // where the store does not tell, or the tree was not listed yet.
+    std::optional<TreeMark> markOfTree(const Url& tree, bool ask);
+    // The dates of the tree's own files ("info", "dateFile"), as of the last listing.
+    std::map<std::string, Date> datesOfTree(const Url& tree);
+    // This client has found it whole, or made it, and nothing has spoken against it since.
+    bool knowsPublishStructure() const;
     // The serial number that the account's own tree is known by; "" for none. A tree that has lost it gets it again.
     void keepSerialNumber(const std::string& serial);
 

@@ -64,6 +64,10 @@ PublishStructure::Missing PublishStructure::look(bool everything) {
 
 bool PublishStructure::check(bool create) {
     std::lock_guard guard(_mutex);
+    return _isKnown = checkNow(create);
+}
+
+bool PublishStructure::checkNow(bool create) {
     Missing missing = look(_doubtful);
     if (!missing.known) return false;
     if (!missing.anything()) {

@@ -16,6 +16,8 @@ public:
     PublishStructure(StoreSession& session, StoreFiles& files) : _session(session), _files(files) {}
 
     bool check(bool create);
+    // The last check has found or made everything, and no write has missed a folder since.
+    bool isKnown() const { return _isKnown && !_doubtful; }
     // After a write found a folder missing: makes what is missing. One thread at a time does it, the others wait.
     bool repair();
     // What a lost "info" is to say again; "" for a new number. A tree that is made anew under its old number is filled
@@ -31,6 +33,7 @@ private:
         bool anything() const { return tree || people || dateFile || info || !buckets.empty(); }
     };
     Missing look(bool everything);
+    bool checkNow(bool create);
     bool complete(const Missing& missing);
     bool makeTree();
     HttpRequest making(const Url& collection) const;
@@ -43,7 +46,7 @@ private:
     StoreFiles& _files;
     std::mutex _mutex; // one completion at a time; guards the following
     std::string _serial;
-    std::atomic<bool> _doubtful{false};
+    std::atomic<bool> _doubtful{false}, _isKnown{false};
 };
 
 } // namespace rolvane

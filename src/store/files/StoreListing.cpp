@@ -52,6 +52,9 @@ struct StoreListing::Asked {
     std::condition_variable changed;
     std::deque<size_t> arrived; // guarded by the mutex
     bool isOfChanges = false;   // one answer, to the question what has changed
+    bool isOfToken = false;     // one answer, to the question for the token
+    bool isTakenIn = false;     // that answer is in the memory
+    std::optional<Date> serverDate;
 
     void arrive(size_t number, HttpResponse answer) {
         const std::lock_guard guard(mutex);
@@ -258,8 +261,8 @@ bool StoreListing::addUnchanged(const Url& container, const std::string& tag, co
 }
 
 StoreListing::AskedRef StoreListing::begin(const Url& container) {
-    if (isBaseLocation(container) && _session.maySynchronize())
-        return _listings.token(container).empty() ? AskedRef() : askForChanges(container);
+    if (isBaseLocation(container) && (_session.maySynchronize() || !_session.hasAnswered()))
+        return _listings.token(container).empty() ? askForToken(container) : askForChanges(container);
     return askForAll(container, _session.mayGiveMembersTags());
 }
 
@@ -268,6 +271,25 @@ StoreListing::AskedRef StoreListing::askForAll(const Url& container, bool tagged
     const Url people = container.cxURLByAppendingComponent("People");
     if (isBaseLocation(container)) asked.push_back(people); // nearly always there, and a way to the store saved
     return ask(asked, tagged ? &people : nullptr);
+}
+
+StoreListing::AskedRef StoreListing::askForToken(const Url& tree) {
+    auto question = SyncedListing(_session, _listings).tokenQuestion(tree);
+    if (!question) return nullptr;
+    auto asked = std::make_shared<Asked>();
+    asked->isOfToken = true;
+    asked->answers.resize(1);
+    _session.start(std::move(*question), [asked](HttpResponse answer) { asked->arrive(0, std::move(answer)); });
+    return asked;
+}
+
+// It tells changes during a listing that follows once more.
+std::string StoreListing::tokenOf(const Url& tree, const AskedRef& begun) {
+    SyncedListing synced(_session, _listings);
+    if (!begun || !begun->isOfToken) return synced.tokenOf(tree);
+    HttpResponse answer = std::move(begun->answers[begun->next()]);
+    return SyncedListing::tokenIn(
+        _session.judged(*synced.tokenQuestion(tree), std::move(answer), [](int) { return true; }));
 }
 
 StoreListing::AskedRef StoreListing::askForChanges(const Url& tree) {
@@ -279,14 +301,24 @@ StoreListing::AskedRef StoreListing::askForChanges(const Url& tree) {
     return asked;
 }
 
-// The tree as the memory has it, once that is up to date.
-std::optional<FileListing> StoreListing::listChanged(const Url& tree, AskedRef begun) {
+bool StoreListing::bringUpToDate(const Url& tree, AskedRef& begun) {
+    if (!isBaseLocation(tree) || !_session.maySynchronize() || _listings.token(tree).empty()) return false;
+    if (begun && begun->isTakenIn) return true;
     SyncedListing synced(_session, _listings);
     if (!begun || !begun->isOfChanges) begun = askForChanges(tree);
     HttpResponse answer = std::move(begun->answers[begun->next()]);
-    const auto serverDate = serverDateOf(answer);
+    begun->serverDate = serverDateOf(answer);
     answer = _session.judged(synced.question(tree), std::move(answer), [](int) { return true; });
-    if (!synced.bringUpToDate(tree, std::move(answer))) return std::nullopt;
+    begun->isTakenIn = synced.bringUpToDate(tree, std::move(answer));
+    if (begun->isTakenIn) return true;
+    begun.reset();
+    return false;
+}
+
+// The tree as the memory has it, once that is up to date.
+std::optional<FileListing> StoreListing::listChanged(const Url& tree, AskedRef begun) {
+    if (!bringUpToDate(tree, begun)) return std::nullopt;
+    const auto serverDate = begun->serverDate;
     const Url people = tree.cxURLByAppendingComponent("People");
     Members top{207, _listings.entries(tree, ListingMemory::kSynced), serverDate};
     FileListing out;
@@ -319,11 +351,10 @@ std::optional<FileListing> StoreListing::list(const Url& container, const AskedR
     if (isBaseLocation(container) && _session.maySynchronize()) {
         if (!_listings.token(container).empty())
             if (auto out = listChanged(container, begun)) return out;
-        // This token tells changes during the listing once more.
-        token = SyncedListing(_session, _listings).tokenOf(container);
+        token = tokenOf(container, begun);
         if (!token.empty()) _listings.forgetBelow(container);
     }
-    const auto answers = readAll(begun && !begun->isOfChanges && token.empty()
+    const auto answers = readAll(begun && !begun->isOfChanges && !begun->isOfToken && token.empty()
                                      ? *begun
                                      : *askForAll(container, token.empty() && _session.mayGiveMembersTags()));
     FileListing out;

@@ -28,8 +28,12 @@ public:
     // Containers that the store was asked to list, with the answers as they come.
     struct Asked;
     using AskedRef = std::shared_ptr<Asked>;
-    // Asks the first questions of `list`. Does not wait. Null where a token has to be asked for before.
+    // Asks the first questions of `list`. Does not wait. Whether the store tells changes may not be known yet: then the
+    // token is asked for first, since a listing that was begun before it would have to be made again.
     AskedRef begin(const Url& container);
+    // Asks what has changed in the tree since it was listed last, and remembers it. `begun` goes on from there, and is
+    // then what `list` goes on from without asking again. False where that cannot be told.
+    bool bringUpToDate(const Url& tree, AskedRef& begun);
     // As CXFileManager::infoForFilesInContainer; `begun`: goes on from there; `part`: as of
     // infoForFilesInContainerByParts.
     std::optional<FileListing> list(const Url& container, const AskedRef& begun = {},
@@ -52,6 +56,8 @@ private:
     enum class Keeping { nothing, tagged, synced };
     AskedRef askForAll(const Url& container, bool tagged);
     AskedRef askForChanges(const Url& tree);
+    AskedRef askForToken(const Url& tree);
+    std::string tokenOf(const Url& tree, const AskedRef& begun);
     std::optional<FileListing> listChanged(const Url& tree, AskedRef begun);
     bool addBuckets(const Members& people, Keeping keeping, FileListing& out, const CXFileManager::ListingPart& part);
     bool addUnchanged(const Url& container, const std::string& tag, const std::optional<Date>& serverDate,

@@ -14,6 +14,7 @@ namespace {
 constexpr size_t kAnswerBytes = 64u << 20;
 constexpr int kMostPages = 10000;
 constexpr int kInsufficientStorage = 507;
+constexpr std::string_view kClockFile = "dateFile"; // which its owner touches with each pass
 
 bool isAny(int) {
     return true;
@@ -50,6 +51,12 @@ std::vector<std::string> segmentsBelow(const Url& tree, const Url& name) {
     return {whole.begin() + static_cast<std::ptrdiff_t>(above.size()), whole.end()};
 }
 
+// A store may tell once more what was told before. Of a collection, what is in it is told by itself.
+bool isSameVersion(const MultistatusEntry& a, const MultistatusEntry& b) {
+    if (a.isCollection || b.isCollection) return a.isCollection == b.isCollection;
+    return a.etag == b.etag && a.lastModified == b.lastModified && a.length == b.length;
+}
+
 struct Edits {
     std::map<std::string, std::optional<MultistatusEntry>> members; // by the name's text; nothing: departed
     Url container;
@@ -58,12 +65,20 @@ struct Edits {
 } // namespace
 
 std::string SyncedListing::tokenOf(const Url& tree) {
+    auto question = tokenQuestion(tree);
+    return question ? tokenIn(_session.send(std::move(*question), isAny)) : std::string();
+}
+
+std::optional<HttpRequest> SyncedListing::tokenQuestion(const Url& tree) const {
     const auto place = _session.collectionEndpoint(tree);
-    if (!place) return {};
+    if (!place) return std::nullopt;
     HttpRequest r = StoreSession::propfind(*place, 0);
     r.body = std::make_shared<const std::string>("<?xml version=\"1.0\" encoding=\"utf-8\"?>\n<propfind "
                                                  "xmlns=\"DAV:\"><prop><sync-token/></prop></propfind>");
-    const HttpResponse answer = _session.send(std::move(r), isAny);
+    return r;
+}
+
+std::string SyncedListing::tokenIn(const HttpResponse& answer) {
     MultistatusReader reader;
     if (!answer.complete() || answer.status != 207 || !reader.feed(answer.body)) return {};
     const auto entries = reader.finish();
@@ -100,22 +115,26 @@ bool SyncedListing::take(const Url& tree, const HttpResponse& answer, bool& isCu
     MultistatusReader reader;
     if (answer.status != 207 || !reader.feed(answer.body)) return false;
     const auto changes = reader.finish();
-    if (!changes || reader.syncToken().empty() || !apply(tree, *changes, isCut)) return false;
+    const auto applied = changes && !reader.syncToken().empty() ? apply(tree, *changes) : std::nullopt;
+    if (!applied) return false;
+    isCut = applied->isCut;
     if (isCut && reader.syncToken() == _memory.token(tree)) return false; // it would never end
-    _memory.keepToken(tree, reader.syncToken());
+    _memory.keepToken(tree, reader.syncToken(), applied->isAnother);
     return true;
 }
 
 // An answer tells of a member before or after the collection that it has come in.
-bool SyncedListing::apply(const Url& tree, const std::vector<MultistatusEntry>& changes, bool& isCut) {
+std::optional<SyncedListing::Applied> SyncedListing::apply(const Url& tree,
+                                                           const std::vector<MultistatusEntry>& changes) {
+    Applied out;
     std::map<std::string, Edits> edits; // by container
     std::vector<Url> departed, collections;
     for (const MultistatusEntry& change : changes) {
         const auto name = _session.nameFor(StoreSession::pathOfHref(change.href));
         if (name && *name == tree) {
-            isCut = isCut || change.status == kInsufficientStorage;
+            out.isCut = out.isCut || change.status == kInsufficientStorage;
             if (change.status == 0 || change.status == 200 || change.status == kInsufficientStorage) continue;
-            return false;
+            return std::nullopt;
         }
         const auto below = name ? segmentsBelow(tree, *name) : std::vector<std::string>();
         if (below.empty()) { // as in a listing
@@ -123,7 +142,7 @@ bool SyncedListing::apply(const Url& tree, const std::vector<MultistatusEntry>& 
             continue;
         }
         const bool isGone = change.status == 404;
-        if (!isGone && change.status != 0 && change.status != 200) return false;
+        if (!isGone && change.status != 0 && change.status != 200) return std::nullopt;
         if (isGone || !change.isCollection) departed.push_back(*name);
         if (!isGone && change.isCollection && holdsListed(below)) collections.push_back(*name);
         if (!isListed(below)) continue;
@@ -134,7 +153,10 @@ bool SyncedListing::apply(const Url& tree, const std::vector<MultistatusEntry>& 
     for (const Url& name : departed)
         if (holdsListed(segmentsBelow(tree, name))) _memory.forgetBelow(name);
     for (const Url& name : collections)
-        if (!_memory.has(name, ListingMemory::kSynced)) _memory.keep(name, ListingMemory::kSynced, {});
+        if (!_memory.has(name, ListingMemory::kSynced)) {
+            _memory.keep(name, ListingMemory::kSynced, {});
+            out.isAnother = true;
+        }
     for (auto& [place, edit] : edits) {
         // One that is not known has departed, or is told on a later page than what is in it.
         const auto known = _memory.entries(edit.container, ListingMemory::kSynced);
@@ -143,16 +165,22 @@ bool SyncedListing::apply(const Url& tree, const std::vector<MultistatusEntry>& 
         ListingMemory::Entries fresh;
         for (const auto& [name, entry] : known.value_or(ListingMemory::Entries())) {
             const auto found = edit.members.find(name.absoluteString());
-            if (found == edit.members.end())
+            if (found == edit.members.end()) {
                 fresh.emplace_back(name, entry);
-            else if (found->second)
-                fresh.emplace_back(name, *std::exchange(found->second, std::nullopt));
+                continue;
+            }
+            const bool isTheClock = edit.container == tree && name.cxLastComponent() == kClockFile;
+            if (!found->second || (!isTheClock && !isSameVersion(entry, *found->second))) out.isAnother = true;
+            if (found->second) fresh.emplace_back(name, *std::exchange(found->second, std::nullopt));
         }
         for (const auto& [name, entry] : edit.members)
-            if (entry) fresh.emplace_back(*Url::parse(name), *entry);
+            if (entry) {
+                fresh.emplace_back(*Url::parse(name), *entry);
+                out.isAnother = true;
+            }
         _memory.keep(edit.container, ListingMemory::kSynced, fresh);
     }
-    return _memory.has(tree, ListingMemory::kSynced);
+    return _memory.has(tree, ListingMemory::kSynced) ? std::optional(out) : std::nullopt;
 }
 
 } // namespace rolvane

@@ -17,6 +17,8 @@ public:
 
     // The token of the tree as it is; "" when the store gives none. To be asked before the tree is listed.
     std::string tokenOf(const Url& tree);
+    std::optional<HttpRequest> tokenQuestion(const Url& tree) const; // the request of that; none outside the account
+    static std::string tokenIn(const HttpResponse& answer);
     HttpRequest question(const Url& tree) const; // what has changed since the token that is kept
     // From the answer to the question on, to its last page. True: the memory holds the tree as the store has it, for
     // all of its containers, by the tag ListingMemory::kSynced. False: it has to be listed, and nothing is kept of it.
@@ -24,7 +26,11 @@ public:
 
 private:
     bool take(const Url& tree, const HttpResponse& answer, bool& isCut);
-    bool apply(const Url& tree, const std::vector<MultistatusEntry>& changes, bool& isCut);
+    struct Applied {
+        bool isCut = false;     // another page follows
+        bool isAnother = false; // something has changed besides the date of the clock file
+    };
+    std::optional<Applied> apply(const Url& tree, const std::vector<MultistatusEntry>& changes);
 
     StoreSession& _session;
     ListingMemory& _memory;

@@ -68,6 +68,7 @@ public:
     bool givesMembersTags() const { return _membersTags; }
     // The same, or it has not been asked yet.
     bool mayGiveMembersTags() const { return _membersTags || _accessLists < 0; }
+    bool hasAnswered() const { return _accessLists >= 0; } // to OPTIONS, in this process
     // Whether collections may be worth the question what has changed in them (RFC 6578), as the server last said.
     bool maySynchronize() const { return _syncs; }
     void doesNotSynchronize() { _syncs = false; } // until it says so again

@@ -66,15 +66,23 @@ void ListingMemory::forgetBelow(const Url& container) {
     });
 }
 
-void ListingMemory::keepToken(const Url& tree, const std::string& token) {
+void ListingMemory::keepToken(const Url& tree, const std::string& token, bool isAnother) {
     const std::lock_guard guard(_mutex);
-    _tokens[tree.absoluteString()] = token;
+    Synced& synced = _tokens[tree.absoluteString()];
+    synced.token = token;
+    if (isAnother || synced.state == 0) synced.state = ++_lastState;
+}
+
+uint64_t ListingMemory::stateOf(const Url& tree) const {
+    const std::lock_guard guard(_mutex);
+    const auto found = _tokens.find(tree.absoluteString());
+    return found == _tokens.end() ? 0 : found->second.state;
 }
 
 std::string ListingMemory::token(const Url& tree) const {
     const std::lock_guard guard(_mutex);
     const auto found = _tokens.find(tree.absoluteString());
-    return found == _tokens.end() ? std::string() : found->second;
+    return found == _tokens.end() ? std::string() : found->second.token;
 }
 
 bool ListingMemory::has(const Url& container, const std::string& tag) const {

@@ -32,8 +32,10 @@ public:
     // Up to where the containers of a tree are known (RFC 6578): those that are kept with the tag kSynced are as the
     // token says. Goes with anything of the memory.
     static constexpr const char* kSynced = "synced";
-    void keepToken(const Url& tree, const std::string& token);
+    // `isAnother`: something in the tree is not as it was when the token before it was kept.
+    void keepToken(const Url& tree, const std::string& token, bool isAnother = true);
     std::string token(const Url& tree) const; // "" when there is none
+    uint64_t stateOf(const Url& tree) const;  // another number for another state, in this process; 0 without a token
     bool has(const Url& container, const std::string& tag) const;
     // The members, named below the container; nothing when it is not kept with this tag.
     std::optional<Entries> entries(const Url& container, const std::string& tag) const;
@@ -70,7 +72,12 @@ private:
 
     mutable std::mutex _mutex; // guards the following
     std::unordered_map<std::string, Container> _containers;
-    std::unordered_map<std::string, std::string> _tokens; // by tree
+    struct Synced {
+        std::string token;
+        uint64_t state = 0;
+    };
+    std::unordered_map<std::string, Synced> _tokens; // by tree
+    uint64_t _lastState = 0;
     size_t _bytes = 0;
 };
 

@@ -1,0 +1,112 @@
+// Passes over trees and databases in which nothing has changed, and the first change after them.
+
+#include "TwoUsers.h"
+
+namespace rolvane::test {
+namespace {
+
+class UnchangedTrees : public TwoUsers {
+protected:
+    // From then on a pass finds everything as it was at a comparison that has found nothing.
+    void settle() {
+        for (int i = 0; i < 3; ++i)
+            for (Participant* user : {&bob, &alice}) user->pass();
+        for (Participant* user : {&bob, &alice}) {
+            user->wire->clear();
+            user->pass();
+            EXPECT_EQ(user->reads("/info"), 0u) << "no short way was gone by " << user->name << "\n"
+                                                << user->wire->text();
+        }
+        ASSERT_EQ(copies(), alice.view());
+    }
+    void bothPass() {
+        for (Participant* user : {&alice, &bob, &alice, &bob}) user->pass();
+    }
+};
+
+TEST_F(UnchangedTrees, APassAsksFiveTimesAtMost) {
+    settle();
+    for (Participant* user : {&alice, &bob}) {
+        user->wire->clear();
+        user->pass();
+        EXPECT_LE(user->wire->exchanges().size(), 5u) << user->name << "\n" << user->wire->text();
+    }
+}
+
+TEST_F(UnchangedTrees, AnEditIsSentWithSixRequestsAndAReadWhereOthersMayWrite) {
+    settle();
+    people[1]->setValue(Value("Benjamin"), kCXFirstNameProperty); // who is in no group
+    alice.application->save();
+    alice.wire->clear();
+    ASSERT_TRUE(alice.database->deliverExternalChanges()); // as an edit comes, without a gathering
+    EXPECT_EQ(alice.wire->count("PUT"), 2u) << alice.wire->text();
+    EXPECT_EQ(alice.reads(""), 1u) << alice.wire->text();
+    EXPECT_LE(alice.wire->exchanges().size(), 7u) << alice.wire->text();
+    bob.pass();
+    EXPECT_EQ(copies(), alice.view());
+}
+
+TEST_F(UnchangedTrees, EveryKindOfChangeArrives) {
+    settle();
+    writeElsewhere(people[1], "Benjamin");
+    bothPass();
+    EXPECT_EQ(copies(), alice.view());
+    EXPECT_EQ(contentOf(fileOf(people[1]))[kCXFirstNameProperty], Value("Benjamin"));
+
+    settle();
+    alice.add("Dora");
+    alice.application->save();
+    bothPass();
+    EXPECT_EQ(copies().size(), alice.view().size());
+    EXPECT_EQ(copies(), alice.view());
+
+    settle();
+    alice.group("Colleagues", {people[1]});
+    alice.application->save();
+    bothPass();
+    EXPECT_EQ(copies(), alice.view());
+
+    settle();
+    alice.application->removeRecord(people[2]);
+    alice.application->save();
+    bothPass();
+    EXPECT_EQ(copies(), alice.view());
+}
+
+TEST_F(UnchangedTrees, AnEditOfTheSubscribersReachesTheOwner) {
+    settle();
+    const auto copy = bob.copyOf(people[0]);
+    copy->setValue(Value("Adelheid"), kCXFirstNameProperty);
+    bob.application->save();
+    for (Participant* user : {&bob, &alice, &bob, &alice}) user->pass();
+    EXPECT_EQ(copies(), alice.view());
+    EXPECT_EQ(contentOf(fileOf(people[0]))[kCXFirstNameProperty], Value("Adelheid"));
+}
+
+TEST_F(UnchangedTrees, ATreeThatWasSetBackIsNoticedByItsClockAlone) {
+    settle();
+    setDate(world->file("dateFile"), dateOf(world->file("dateFile")) - 3600);
+    log.clear();
+    bob.pass();
+    EXPECT_NE(log.text().find("is a copy from another time"), std::string::npos) << log.text();
+}
+
+TEST_F(UnchangedTrees, AWithdrawnTreeEndsTheSubscription) {
+    bob.add("Own");
+    bob.publish(); // a reason to live on
+    settle();
+    std::filesystem::remove_all(world->file());
+    bob.pass();
+    EXPECT_TRUE(copies().empty());
+}
+
+TEST_F(UnchangedTrees, TheSubscribersOwnTreeIsMadeAgainWhenItIsGone) {
+    settle();
+    std::filesystem::remove_all(world->file("", "bob"));
+    bob.pass();
+    EXPECT_TRUE(std::filesystem::is_regular_file(world->file("info", "bob")));
+    EXPECT_EQ(copies(), alice.view());
+}
+
+} // namespace
+} // namespace rolvane::test
