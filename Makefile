@@ -83,6 +83,8 @@ bench:
 	bench/subscribers.py build/bench
 	bench/books.py build/bench
 	bench/bookput.py build/bench
+	BENCH_DOCS=docs/performance.md bench/onechange.py build/bench
+	BENCH_DOCS=docs/performance.md bench/news.py build/bench
 
 lint:
 	@packaging/setup build test lint

@@ -212,6 +212,22 @@ class Publisher(Person):
         return {"contact_puts": sum(puts.values()), "other_requests": dict(rest)}
 
 
+def put_table(name, lines):
+    """Puts what a run has found into the place that has its name in the document that BENCH_DOCS names, if any."""
+    path = os.environ.get("BENCH_DOCS")
+    if not path:
+        return
+    with open(path) as document:
+        text = document.read()
+    begin, end = f"<!-- {name}: written by the benchmark -->\n", f"<!-- end of {name} -->"
+    if text.count(begin) != 1 or text.find(end) < text.find(begin):
+        raise Failure(f"{path} has no place for {name}")
+    seen = f"{time.strftime('%F')}, {os.cpu_count()} processors, load {os.getloadavg()[0]:.1f}:"
+    rest = text[text.find(end):]
+    with open(path, "w") as document:
+        document.write(text[:text.find(begin) + len(begin)] + "\n".join(["", seen, "", *lines, "", rest]))
+
+
 def save_json(path, data):
     with open(path, "w") as out:
         json.dump(data, out, indent=1, sort_keys=True)

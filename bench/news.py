@@ -16,7 +16,7 @@ import statistics
 import sys
 import time
 
-from benchworld import PASSWORD, Failure, Person, Publisher, Store, World
+from benchworld import PASSWORD, Failure, Person, Publisher, Store, World, put_table
 
 PEOPLE, MOST_SECONDS, MOST_MEGABYTES = 100, 1.0, 100
 OF_ONE_USER = 16  # requests that the store lets one user have
@@ -168,6 +168,15 @@ def main(build, count=40, held=1000):
               f"{middle:.0f} ms, the last within {last:.0f} ms")
         for connection in connections:
             connection.close()
+        put_table("news", [
+            "| what | seen | aim |", "|---|---|---|",
+            f"| an edit in the other person's database, from the end of `rolvane edit`: median of {count} | "
+            f"{1000 * statistics.median(ended):.0f} ms | 1,000 ms |",
+            f"| the slowest of them | {1000 * max(ended):.0f} ms | |",
+            f"| requests of the reader for an edit | {requests / count:.1f} | |",
+            f"| memory of httpd for {held} requests that wait | {memory:.0f} MB | 100 MB |",
+            f"| CPU for them at rest | {1000 * idle:.1f} ms a second | |",
+            f"| after a change the first, the middle, the last has its line | {first:.0f}, {middle:.0f}, {last:.0f} ms | |"])
         return 0 if statistics.median(ended) <= MOST_SECONDS and memory <= MOST_MEGABYTES else 1
 
 
