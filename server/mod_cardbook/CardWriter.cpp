@@ -111,8 +111,9 @@ CXRecordRef CardWriter::recordOf(const std::string& uid, std::string_view table)
     return nullptr;
 }
 
-void CardWriter::conflict(const Member& other) {
-    const std::string path = escapedPath(pathOf(_c.base, {Place::Kind::card, _c.book.id, other.name}));
+void CardWriter::conflict(const Member& other, const std::string& book) {
+    const std::string path =
+        escapedPath(pathOf(_c.base, {Place::Kind::card, book.empty() ? _c.book.id : book, other.name}));
     throw Refused(409, kCardSpace, "no-uid-conflict", "Another card has this UID, or this card has another one.",
                   "<D:href>" + xmlText(path) + "</D:href>");
 }
@@ -328,14 +329,18 @@ bool CardWriter::join(const Book& to, const std::string& name, bool mayReplace) 
     const auto there = _memory.named(to.id, name);
     if (there && (!mayReplace || there->uid != now->uid)) throw changedMeanwhile();
     const auto here = _memory.of(to.id, now->uid);
-    if (here && here->name != name) conflict(*here);
+    if (here && here->name != name) conflict(*here, to.id);
     if (!here) wish(to, now->uid, name);
     groupOf(to)->addMember(person);
     return !there;
 }
 
 bool CardWriter::copy(const Book& to, const std::string& name, bool mayReplace) {
-    if (_c.book.kind == Book::Kind::shared || to.kind != Book::Kind::group || to.id == _c.book.id)
+    // There the card would be twice.
+    if (const auto card = _memory.named(_c.book.id, _c.name); card && to.kind != Book::Kind::shared)
+        if (const auto there = _memory.of(to.id, card->uid); there && (to.id == _c.book.id || there->name != name))
+            conflict(*there, to.id);
+    if (_c.book.kind == Book::Kind::shared || to.kind != Book::Kind::group)
         throw notHere("A card has one UID, so it is copied from \"Contacts\" or a group into another group only.");
     if (!isUsableName(name)) throw notHere("A card cannot be called so.");
     const Turn turn(bookMemoryPath(_rolvane.path()) + ".lock");

@@ -42,7 +42,7 @@ private:
     std::optional<Member> settle();
     void requireWritable(const Book& book) const;
     CXRecordRef recordOf(const std::string& uid, std::string_view table);
-    [[noreturn]] void conflict(const Member& other);
+    [[noreturn]] void conflict(const Member& other, const std::string& book = {}); // in that book, else in this one
     void requireFreeUID(const ClientCard& card, const std::optional<Member>& now);
     CXRecordRef target(const ClientCard& card, const std::optional<Member>& now);
     Written putPerson(const ClientCard& card, const std::optional<Member>& now);

@@ -1,9 +1,11 @@
 #include "server/mod_cardbook/Repository.h"
 
+#include "contacts/vcard/VCardText.h"
 #include "server/mod_cardbook/Devices.h"
 #include "server/mod_cardbook/Resource.h"
 #include "server/mod_cardbook/Writing.h"
 
+#include <algorithm>
 #include <string_view>
 
 namespace rolvane::cardbook {
@@ -72,14 +74,28 @@ const char* noPath(const dav_resource*) noexcept {
 
 // Reading ----------------------------------------------------------------------------------------------------------
 
-// Which version an Accept header wants; nothing: whichever there is.
+// Which version an Accept header wants; nothing: whichever there is. A header that leaves neither version is refused
+// (RFC 6352 section 5.1.1.1). Of several the first one counts: address books name one.
 std::optional<VCardVersion> acceptedVersion(const request_rec* r) {
     const char* accept = apr_table_get(r->headers_in, "Accept");
-    const std::string_view text = accept ? accept : "";
-    const size_t at = text.find("version=");
-    if (at == std::string_view::npos) return std::nullopt;
-    const std::string_view rest = text.substr(at + std::string_view("version=").size());
-    return rest.starts_with("4") || rest.starts_with("\"4") ? VCardVersion::v4 : VCardVersion::v3;
+    if (!accept || !*accept) return std::nullopt;
+    const std::string text = vcardLower(accept);
+    for (size_t at = 0; at < text.size();) {
+        const size_t end = std::min(text.find(',', at), text.size());
+        std::string range = text.substr(at, end - at);
+        at = end + 1;
+        std::erase_if(range, [](char c) { return c == ' ' || c == '\t' || c == '"'; });
+        const std::string type = range.substr(0, range.find(';'));
+        if (type == "*/*" || type == "text/*") return std::nullopt;
+        if (type != "text/vcard" && type != "text/x-vcard" && type != "text/directory") continue;
+        const size_t version = range.find(";version=");
+        if (version == std::string::npos) return std::nullopt;
+        const std::string_view number = std::string_view(range).substr(version + std::string_view(";version=").size());
+        if (number.starts_with("4")) return VCardVersion::v4;
+        if (number.starts_with("3")) return VCardVersion::v3;
+    }
+    throw Refused(HTTP_NOT_ACCEPTABLE, kCardSpace, "supported-address-data-conversion",
+                  "Cards are text/vcard of version 3.0 or 4.0.");
 }
 
 dav_error* setHeaders(request_rec* r, const dav_resource* resource) noexcept {

@@ -84,9 +84,49 @@ TEST_F(BooksCommand, AreServedToADeviceWithItsPasswordAndToNobodyElse) {
     EXPECT_EQ(status("", ""), "401");
     EXPECT_EQ(status("laptop", "wrong"), "401");
     EXPECT_EQ(status("phone", password), "401");
-    EXPECT_EQ(ask("", "", ".well-known/carddav").substr(0, 3), "301");
     EXPECT_EQ(ask("laptop", password, "../conf/passwords", {"--path-as-is"}).substr(0, 3), "400");
     EXPECT_EQ(ask("laptop", password, "conf/passwords").substr(0, 3), "403");
+}
+
+// RFC 6764 section 5. A stranger hears the same as a device: no device, no book, no other path. KAddressBook sends its
+// password to the first address alone, and would go round in circles where that one asked for it.
+TEST_F(BooksCommand, LeadOnFromTheHostAloneAndTellNothingElseBeforeASignIn) {
+    const Json on = json({"books", "on"});
+    const std::string password = addDevice("laptop");
+    for (const std::string path : {"", ".well-known/carddav", ".well-known/carddav/"}) {
+        for (const std::string method : {"GET", "PROPFIND", "OPTIONS"}) {
+            SCOPED_TRACE(method + " /" + path);
+            const std::vector<std::string> how = {"-X", method, "-w", "\n%{http_code} %{redirect_url}"};
+            const std::string told = ask("", "", path, how);
+            EXPECT_THAT(told, testing::StartsWith("301 " + on["url"].get<std::string>() + "books/\n"));
+            EXPECT_EQ(ask("laptop", password, path, how), told);
+            EXPECT_EQ(ask("laptop", "wrong", path, how), told);
+            for (const char* word : {"laptop", "home", "principal", "contacts", "Miller"})
+                EXPECT_THAT(told, Not(HasSubstr(word)));
+        }
+    }
+    EXPECT_THAT(ask("", "", ".well-known/carddav", {"-i"}), HasSubstr("\r\nCache-Control: max-age=3600\r\n"));
+    EXPECT_EQ(ask("", "", ".well-known/caldav").substr(0, 3), "403");
+    for (const char* path : {"books", "books/", "books/principal/", "books/home/", "books/home/contacts/"})
+        EXPECT_EQ(ask("", "", path).substr(0, 3), "401") << path;
+    EXPECT_EQ(ask("", "", "bookshelf").substr(0, 3), "403");
+}
+
+TEST_F(BooksCommand, TheirPasswordsOpenNoStoreAndTheStoresOpenNoBooks) {
+    const std::string store = world.store().baseURL() + "/" + UserWorld::kUser + "/";
+    const std::string alice = UserWorld::kUser, word = UserWorld::kPassword;
+    done({"books", "on"});
+    const std::string password = json({"books", "device", "add", alice})["password"]; // called as the store's user is
+    const auto ofStore = [&](const std::string& given) {
+        return world
+            .run({"curl", "-q", "-ksS", "--noproxy", "*", "-o", "/dev/null", "-w", "%{http_code}", "-X", "PROPFIND",
+                  "-H", "Depth: 0", "-u", alice + ":" + given, store})
+            .output;
+    };
+    EXPECT_EQ(ofStore(word), "207");
+    EXPECT_EQ(ofStore(password), "401");
+    EXPECT_EQ(status(alice, password), "207");
+    EXPECT_EQ(status(alice, word), "401");
 }
 
 TEST_F(BooksCommand, ADeviceThatIsRemovedOrGotAnotherPasswordIsRefusedAtTheNextRequest) {
