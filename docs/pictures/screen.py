@@ -74,7 +74,7 @@ class Screen:
         """Waits until the screen has stood still for a second; a cursor may blink."""
         before, still = None, 0
         for _ in range(PATIENCE * 4):
-            now = self.tool("import", "-window", "root", "-resize", "25%", "gray:-")
+            now = self.tool("import", "-window", "root", "-resize", "25%", "-depth", "8", "gray:-")
             still = still + 1 if before and sum(abs(a - b) > 40 for a, b in zip(now, before)) < 20 else 0
             if still >= 4:
                 return
