@@ -10,7 +10,7 @@ TESTS  ?=
 CTEST   = ctest -j$(JOBS) --no-tests=error --output-on-failure $(if $(TESTS),-R '$(TESTS)')
 
 .DEFAULT_GOAL := help
-.PHONY: help setup build demo test worlds board interop pictures asan tsan fuzz bench lint format install install-symbols deb clean
+.PHONY: help setup build demo test worlds board interop pictures asan tsan fuzz bench lint format install install-symbols uninstall deb deb-test clean
 
 help:
 	@echo 'make demo              set up, build, and show the main job on a private store'
@@ -26,7 +26,9 @@ help:
 	@echo 'make build             only build (release)'
 	@echo 'make install           install under PREFIX (/usr/local), DESTDIR is honoured'
 	@echo 'make install-symbols   what a debugger wants to know of it, under PREFIX/lib/debug'
-	@echo 'make deb               a Debian package in build/release, and one with the symbols'
+	@echo 'make uninstall         remove what was installed under PREFIX; what lies in homes stays'
+	@echo 'make deb               Debian packages in build/release/packages, and those with the symbols; lintian looks at them'
+	@echo 'make deb-test          install them in a fresh root, use, upgrade, remove and purge them (as root)'
 	@echo 'make setup             install the Debian packages that building and testing need'
 	@echo 'make clean             remove build/'
 
@@ -104,10 +106,18 @@ install-symbols:
 	@test -f build/release/build.ninja || { echo 'make install-symbols: nothing is built yet. Run "make build" first.' >&2; exit 1; }
 	cmake --install build/release --prefix '$(PREFIX)' --component debug
 
+# Takes away what `make install` and `make install-symbols` put there, file by file, and directories that are empty then.
+uninstall:
+	@test -f build/release/build.ninja || { echo 'make uninstall: it is told by the build what was installed. Run "make build" first.' >&2; exit 1; }
+	packaging/uninstall build/release '$(PREFIX)'
+
 deb: build
 	@packaging/setup deb
-	cd build/release && cpack -G DEB
-	cd build/release && cpack -G DEB --config CPackSymbols.cmake
+	packaging/deb build/release
+
+deb-test: build
+	@packaging/setup deb
+	tests/packages/run build/release
 
 clean:
 	rm -rf build

@@ -27,8 +27,11 @@ endif()
 function(rolvane_install target kind destination)
   install(TARGETS ${target} ${kind} DESTINATION ${destination})
   set(installed "\$ENV{DESTDIR}\${CMAKE_INSTALL_PREFIX}/${destination}/$<TARGET_FILE_NAME:${target}>")
+  # The Debian packages are made of programs that have their symbols still.
   install(CODE "
-    execute_process(COMMAND \"${CMAKE_STRIP}\" --strip-unneeded \"${installed}\" COMMAND_ERROR_IS_FATAL ANY)")
+    if(NOT DEFINED ENV{ROLVANE_KEEP_SYMBOLS})
+      execute_process(COMMAND \"${CMAKE_STRIP}\" --strip-unneeded \"${installed}\" COMMAND_ERROR_IS_FATAL ANY)
+    endif()")
   install(CODE "
     execute_process(COMMAND \"${CMAKE_READELF}\" -n \"$<TARGET_FILE:${target}>\" OUTPUT_VARIABLE notes
                     ERROR_QUIET COMMAND_ERROR_IS_FATAL ANY)

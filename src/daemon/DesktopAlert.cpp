@@ -21,6 +21,7 @@ struct SlotUnref {
 };
 
 constexpr const char* kService = "org.freedesktop.Notifications";
+constexpr const char* kDesktopEntry = "net.rolvane.Rolvane"; // whose icon stands beside the notice
 constexpr const char* kPath = "/org/freedesktop/Notifications";
 
 struct Answer {
@@ -68,7 +69,8 @@ void DesktopAlert::tell(const Text& text) {
     constexpr uint64_t kPatience = 2000000; // microseconds
     sd_bus_set_method_call_timeout(bus.get(), kPatience);
     sd_bus_call_method(bus.get(), kService, kPath, kService, "Notify", nullptr, nullptr, "susssasa{sv}i", "Rolvane", 0u,
-                       text.icon.c_str(), text.header.c_str(), text.message.c_str(), 0, 1, "urgency", "y", 1, -1);
+                       text.icon.c_str(), text.header.c_str(), text.message.c_str(), 0, 2, "urgency", "y", 1,
+                       "desktop-entry", "s", kDesktopEntry, -1);
 }
 
 void DesktopAlert::show(const Text& text) {
@@ -90,10 +92,10 @@ void DesktopAlert::show(const Text& text) {
     constexpr uint8_t kCritical = 2;
     const bool plain = text.level >= kPlainLevel;
     sd_bus_message* reply = nullptr;
-    const int sent =
-        sd_bus_call_method(raw, kService, kPath, kService, "Notify", nullptr, &reply, "susssasa{sv}i", "Rolvane", 0u,
-                           text.icon.c_str(), text.header.c_str(), text.message.c_str(), 2, "default",
-                           text.defaultButton.c_str(), 1, "urgency", "y", plain ? 1 : kCritical, 0);
+    const int sent = sd_bus_call_method(raw, kService, kPath, kService, "Notify", nullptr, &reply, "susssasa{sv}i",
+                                        "Rolvane", 0u, text.icon.c_str(), text.header.c_str(), text.message.c_str(), 2,
+                                        "default", text.defaultButton.c_str(), 2, "urgency", "y", plain ? 1 : kCritical,
+                                        "desktop-entry", "s", kDesktopEntry, 0);
     const std::unique_ptr<sd_bus_message, MessageUnref> ownsReply(reply);
     if (sent < 0 || sd_bus_message_read_basic(reply, 'u', &answer.id) <= 0) return;
 
