@@ -42,10 +42,16 @@ def publish(person):
     watching = watch(person)
     publishing = person.start("publish", stdout=subprocess.DEVNULL, stderr=subprocess.PIPE)
     talk = publishing.communicate()[1]
-    watching.send_signal(signal.SIGINT)
-    heard = watching.communicate()[0]
     if publishing.returncode != 0:
+        watching.kill()
         raise Failure(f"`rolvane publish` ended with {publishing.returncode}: {talk.strip()}")
+    heard = ""
+    for line in watching.stdout:  # two programs hear of the end, and this one may be the later of them
+        heard += line
+        if '"stopped"' in line:
+            break
+    watching.send_signal(signal.SIGINT)
+    heard += watching.communicate()[0]
     steps = re.findall(r'"event":"progress".*?"fraction":([0-9.e-]+)', heard)
     for line in talk.strip().splitlines():
         say(line)

@@ -8,6 +8,7 @@
 
 #include <algorithm>
 #include <filesystem>
+#include <fstream>
 
 namespace rolvane::test {
 namespace {
@@ -98,6 +99,26 @@ TEST(Hardening, WhatIsInstalledHasNoSymbolsAndTheyAreToBeHadApart) {
             ++found;
         }
     EXPECT_EQ(found, builtFiles().size());
+}
+
+TEST(Uninstalling, TakesAwayWhatWasInstalledAndNothingElse) {
+    namespace fs = std::filesystem;
+    const TempDirectory directory;
+    const std::string prefix = directory / "usr/local";
+    install(prefix);
+    const std::string settings = prefix + "/etc/apache2/mods-available/davacl.conf", others = prefix + "/bin/other";
+    std::ofstream(settings, std::ios::app) << "# an administrator's line\n";
+    std::ofstream(others) << "somebody else's\n";
+    ChildProcess uninstalling(
+        ChildProcess::Options{.arguments = {ROLVANE_SOURCE_DIR "/packaging/uninstall", ROLVANE_BINARY_DIR, prefix}});
+    const auto ending = uninstalling.wait(120);
+    ASSERT_TRUE(ending && ending->exitedWith(0)) << uninstalling.output() << uninstalling.errors();
+    std::vector<std::string> left;
+    for (const auto& each : fs::recursive_directory_iterator(directory.path()))
+        if (!each.is_directory()) left.push_back(each.path());
+    EXPECT_THAT(left, testing::UnorderedElementsAre(settings, others));
+    EXPECT_FALSE(fs::exists(prefix + "/share")) << "an empty directory stays";
+    EXPECT_NE(uninstalling.output().find(settings), std::string::npos) << uninstalling.output();
 }
 
 } // namespace
