@@ -4,6 +4,7 @@
 #include "server/mod_davacl/MembersTag.h"
 #include "server/mod_davacl/News.h"
 #include "server/mod_davacl/PrincipalResources.h"
+#include "server/mod_davacl/ReportBody.h"
 #include "server/mod_davacl/Reports.h"
 #include "server/mod_davacl/SyncCollection.h"
 #include "server/mod_davacl/WaitingRequests.h"

@@ -10,7 +10,6 @@ namespace rolvane::davacl {
 
 // A property of our own: of a collection of files, its MembersTag. It is announced in the DAV header (RFC 4918 section
 // 10.1), because on a server that does not know it anybody could set a property of that name.
-inline constexpr const char* kOwnNamespace = "http://rolvane.net/ns/";
 inline constexpr const char* kMembersTagName = "members-tag";
 inline constexpr const char* kMembersTagClass = "<http://rolvane.net/ns/members-tag>";
 // That collections can be synchronised, so that nobody has to ask each for its reports.

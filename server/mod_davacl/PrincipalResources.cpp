@@ -166,9 +166,8 @@ bool readBody(const apr_xml_doc* doc, std::vector<Wanted>& wanted, bool& namesOn
     }
     const apr_xml_elem* prop = dav_find_child(doc->root, "prop");
     if (!prop) return false;
-    for (const apr_xml_elem* e = prop->first_child; e; e = e->next)
-        wanted.push_back({e->ns < 0 ? "" : APR_XML_GET_URI_ITEM(doc->namespaces, e->ns), e->name});
-    return true;
+    wanted = namesIn(doc, prop);
+    return canBeAnswered(wanted);
 }
 
 std::string responseFor(request_rec* r, const Configuration& c, const Place& place, const std::vector<Wanted>& wanted,
@@ -177,10 +176,10 @@ std::string responseFor(request_rec* r, const Configuration& c, const Place& pla
     for (const Wanted& property : wanted) {
         const auto value = property.space == "DAV:" ? valueOf(r, c, place, property.name) : std::nullopt;
         if (!value) {
-            if (!namesOnly) missing += emptyElement(r, property);
+            if (!namesOnly) missing += emptyElement(r->pool, property);
             continue;
         }
-        found += namesOnly || value->empty() ? emptyElement(r, property)
+        found += namesOnly || value->empty() ? emptyElement(r->pool, property)
                                              : "<D:" + property.name + ">" + *value + "</D:" + property.name + ">";
     }
     std::string text = "<D:response>\n" + hrefElement(r, pathOf(c, place)) + "\n";
@@ -288,11 +287,6 @@ int serve(request_rec* r) {
 
 int servePrincipals(request_rec* r) noexcept {
     return contained(r, static_cast<int>(HTTP_INTERNAL_SERVER_ERROR), [r] { return serve(r); });
-}
-
-std::string emptyElement(request_rec* r, const Wanted& property) {
-    if (property.space == "DAV:") return "<D:" + property.name + "/>";
-    return "<" + property.name + " xmlns=\"" + apr_xml_quote_string(r->pool, property.space.c_str(), 1) + "\"/>";
 }
 
 std::string propstat(const std::string& properties, const char* status) {

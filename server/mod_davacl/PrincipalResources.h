@@ -1,6 +1,7 @@
 #pragma once
 
 #include "server/mod_davacl/Access.h"
+#include "server/mod_davacl/ReportBody.h"
 
 #include <optional>
 #include <string>
@@ -25,10 +26,6 @@ std::optional<Principal> principalAt(request_rec* r, const Configuration& c, con
 // The user, and the groups that the user is in: whom a listing shows.
 std::vector<Principal> ownPrincipals(request_rec* r, const Configuration& c);
 
-struct Wanted {
-    std::string space, name; // of a property
-};
-std::string emptyElement(request_rec* r, const Wanted& property);
 std::string propstat(const std::string& properties, const char* status);
 // What PROPFIND of the principal with Depth 0 tells, as a <D:response>; one with status 404 when there is none.
 std::string principalResponse(request_rec* r, const Configuration& c, const Principal& principal,

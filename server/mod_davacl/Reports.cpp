@@ -2,6 +2,7 @@
 
 #include "server/mod_davacl/LiveProperties.h"
 #include "server/mod_davacl/PrincipalResources.h"
+#include "server/mod_davacl/ReportBody.h"
 #include "server/mod_davacl/SyncCollection.h"
 #include "server/mod_davacl/WaitingRequests.h"
 #include "server/mod_davacl/XmlElements.h"
@@ -45,13 +46,6 @@ struct Report {
         count();
     }
 };
-
-std::vector<Wanted> namesIn(const apr_xml_doc* doc, const apr_xml_elem* prop) {
-    std::vector<Wanted> wanted;
-    for (const apr_xml_elem* e = prop ? prop->first_child : nullptr; e; e = e->next)
-        wanted.push_back({spaceOf(doc, e), e->name});
-    return wanted;
-}
 
 std::string lowered(std::string text) {
     for (char& c : text)
@@ -161,10 +155,10 @@ void matchOwned(Report& q) {
 }
 
 void matchPrincipals(Report& q) {
-    const apr_xml_elem* property = child(q.doc->root, "principal-property");
-    const apr_xml_elem* name = property ? property->first_child : nullptr;
-    if (!child(q.doc->root, "self") == !name)
-        return q.refuse("DAV:principal-match says self or one principal-property.");
+    const char* problem = nullptr;
+    const auto match = parsePrincipalMatch(q.doc, problem);
+    if (!match) return q.refuse(problem);
+    const apr_xml_elem* name = match->property;
     if (q.resource) {
         if (name && (isDav(name, "owner") || isDav(name, "current-user-principal"))) matchOwned(q);
         return;
@@ -180,13 +174,8 @@ void matchPrincipals(Report& q) {
 
 // -- principal-property-search (section 9.4)
 
-struct Search {
-    std::vector<Wanted> properties;
-    std::string match;
-};
-
 // Only names are searched.
-bool meets(const Principal& principal, const Search& search) {
+bool meets(const Principal& principal, const PropertySearch& search) {
     return std::all_of(search.properties.begin(), search.properties.end(), [&](const Wanted& property) {
         return property.space == "DAV:" && property.name == "displayname" &&
                lowered(principal.name).find(lowered(search.match)) != std::string::npos;
@@ -194,9 +183,9 @@ bool meets(const Principal& principal, const Search& search) {
 }
 
 // Whom the user may know of: those whom a listing shows, and whom the searches call by their whole name.
-std::vector<Principal> searched(Report& q, const std::vector<Search>& searches) {
+std::vector<Principal> searched(Report& q, const std::vector<PropertySearch>& searches) {
     std::vector<Principal> known = ownPrincipals(q.r, q.c);
-    for (const Search& search : searches)
+    for (const PropertySearch& search : searches)
         for (const auto kind : {Principal::Kind::user, Principal::Kind::group}) {
             const Principal named{kind, search.match};
             if (isUsableName(search.match) && std::find(known.begin(), known.end(), named) == known.end() &&
@@ -207,43 +196,21 @@ std::vector<Principal> searched(Report& q, const std::vector<Search>& searches) 
 }
 
 void searchPrincipals(Report& q) {
-    std::vector<Search> searches;
-    for (const apr_xml_elem* e = q.doc->root->first_child; e; e = e->next)
-        if (isDav(e, "property-search"))
-            searches.push_back({namesIn(q.doc, child(e, "prop")), textOf(child(e, "match"))});
-    if (searches.empty() || std::any_of(searches.begin(), searches.end(),
-                                        [](const Search& s) { return s.properties.empty() || s.match.empty(); }))
-        return q.refuse("DAV:property-search says a property and what it matches.");
+    const char* problem = nullptr;
+    const auto read = parseSearches(q.doc, problem);
+    if (!read) return q.refuse(problem);
+    const std::vector<PropertySearch>& searches = *read;
     if (searches.size() > kMostSearches)
         return q.fail("number-of-matches-within-limits", "There are too many searches in one report.");
     const bool everywhere = child(q.doc->root, "apply-to-principal-collection-set");
     const auto wanted = namesIn(q.doc, child(q.doc->root, "prop"));
     for (const Principal& principal : searched(q, searches))
         if ((everywhere || isHeldBy(q, principal)) &&
-            std::all_of(searches.begin(), searches.end(), [&](const Search& s) { return meets(principal, s); }))
+            std::all_of(searches.begin(), searches.end(), [&](const PropertySearch& s) { return meets(principal, s); }))
             q.add(principalResponse(q.r, q.c, principal, wanted));
 }
 
 // -- expand-property (RFC 3253 section 3.8)
-
-size_t depthOf(const apr_xml_elem* element, size_t most) {
-    size_t deepest = 0;
-    for (const apr_xml_elem* e = element->first_child; e && most; e = e->next)
-        deepest = std::max(deepest, depthOf(e, most - 1));
-    return deepest + 1;
-}
-
-Wanted nameOf(const apr_xml_elem* property) {
-    const std::string space = attributeOf(property, "namespace");
-    return {space.empty() ? "DAV:" : space, attributeOf(property, "name")};
-}
-
-std::string unquoted(std::string text) {
-    for (const auto& [from, to] : {std::pair("&lt;", "<"), {"&gt;", ">"}, {"&amp;", "&"}})
-        for (size_t at = 0; (at = text.find(from, at)) != std::string::npos; ++at)
-            text.replace(at, std::strlen(from), to);
-    return text;
-}
 
 std::string expandedPrincipal(Report& q, const Principal& principal, const apr_xml_elem* properties);
 
@@ -276,7 +243,7 @@ std::string expandedPrincipal(Report& q, const Principal& principal, const apr_x
         if (value)
             found += "<D:" + wanted.name + ">" + expanded(q, *value, e) + "</D:" + wanted.name + ">";
         else
-            missing += emptyElement(q.r, wanted);
+            missing += emptyElement(q.r->pool, wanted);
         if (found.size() + missing.size() > kMostBytes)
             q.fail("number-of-matches-within-limits", "The report would be too long.");
     }
@@ -284,20 +251,6 @@ std::string expandedPrincipal(Report& q, const Principal& principal, const apr_x
     if (!found.empty() || missing.empty()) text += propstat(found, "200 OK");
     if (!missing.empty()) text += propstat(missing, "404 Not Found");
     return text + "</D:response>\n";
-}
-
-bool isXmlName(const std::string& name) {
-    return !name.empty() && !std::strchr("-.0123456789", name[0]) &&
-           std::all_of(name.begin(), name.end(), [](unsigned char c) {
-               return c >= 0x80 || (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || (c >= '0' && c <= '9') ||
-                      c == '-' || c == '.' || c == '_';
-           });
-}
-
-bool areNamed(const apr_xml_elem* properties) {
-    for (const apr_xml_elem* e = properties->first_child; e; e = e->next)
-        if (isDav(e, "property") && (!isXmlName(nameOf(e).name) || !areNamed(e))) return false;
-    return true;
 }
 
 // A document as PROPFIND has it, with the properties that are not ours.
@@ -341,7 +294,7 @@ void expandOnTree(Report& q) {
 }
 
 void expandProperties(Report& q) {
-    if (depthOf(q.doc->root, kDeepestExpansion + 2) > kDeepestExpansion + 1)
+    if (isDeeperThan(q.doc->root, kDeepestExpansion + 1))
         return q.fail("number-of-matches-within-limits", "The properties are nested too deeply.");
     if (!areNamed(q.doc->root)) return q.refuse("DAV:property has the name of a property.");
     if (q.resource) return expandOnTree(q);
@@ -398,6 +351,8 @@ int answer(Report& q) {
         if (!isDav(q.doc->root, report.name) || (!q.resource && report.on != On::everything)) continue;
         if (dav_get_depth(q.r, 0) != 0)
             q.refuse("The report is about the resource itself: send Depth 0, or none.");
+        else if (!canBeAnswered(namesIn(q.doc, child(q.doc->root, "prop"))))
+            q.refuse("A name of a property has two colons.");
         else
             report.answer(q);
         if (q.error) return q.error->status;

@@ -4,7 +4,7 @@
 #include "server/mod_davacl/LiveProperties.h"
 #include "server/mod_davacl/News.h"
 #include "server/mod_davacl/Passwords.h"
-#include "server/mod_davacl/XmlElements.h"
+#include "server/mod_davacl/ReportBody.h"
 
 #include <algorithm>
 #include <ap_mpm.h>
@@ -442,11 +442,10 @@ std::optional<TreePath> treeAt(request_rec* r, const Configuration& c, const std
 }
 
 // Nothing when something is wrong with it; then `error` says what.
-std::vector<TreePath> treesIn(request_rec* r, const Configuration& c, const apr_xml_doc* doc, dav_error** error) {
+std::vector<TreePath> treesIn(request_rec* r, const Configuration& c, const NewsBody& body, dav_error** error) {
     std::vector<TreePath> trees;
-    for (const apr_xml_elem* each = doc->root->first_child; each; each = each->next) {
-        if (!isDav(each, "href")) continue;
-        auto tree = treeAt(r, c, textOf(each));
+    for (const std::string& href : body.hrefs) {
+        auto tree = treeAt(r, c, href);
         if (!tree) {
             *error = complaint(r, HTTP_BAD_REQUEST,
                                "An href names no tree: a collection below the base, as near to it as lists are kept.");
@@ -459,12 +458,6 @@ std::vector<TreePath> treesIn(request_rec* r, const Configuration& c, const apr_
         return {};
     }
     return trees;
-}
-
-std::optional<std::string> sinceIn(const apr_xml_doc* doc) {
-    for (const apr_xml_elem* each = doc->root->first_child; each; each = each->next)
-        if (std::strcmp(each->name, "since") == 0 && spaceOf(doc, each) == kOwnNamespace) return textOf(each);
-    return std::nullopt;
 }
 
 apr_status_t forgetWaiter(void* id) {
@@ -502,10 +495,6 @@ constexpr const char* kWaits = "davacl-waits"; // a note of a request that waits
 
 } // namespace
 
-bool isNewsReport(const apr_xml_doc* doc) {
-    return std::strcmp(doc->root->name, kNewsReport) == 0 && spaceOf(doc, doc->root) == kOwnNamespace;
-}
-
 std::string newsReportElement() {
     return std::string("<D:supported-report><D:report><R:") + kNewsReport + " xmlns:R=\"" + kOwnNamespace +
            "\"/></D:report></D:supported-report>";
@@ -519,14 +508,14 @@ int waitForNews(request_rec* r, const Configuration& c, const apr_xml_doc* doc, 
     // mod_http2 ends a stream that is suspended with an error, and the prefork MPM suspends nothing.
     if (!waiters || !tellsNews(r) || r->connection->master || r->main)
         return fails(HTTP_NOT_IMPLEMENTED, "News are told over HTTP/1.1, where DavAclNews is on and the MPM is event.");
-    auto trees = treesIn(r, c, doc, error);
+    const NewsBody body = readNewsBody(doc);
+    auto trees = treesIn(r, c, body, error);
     if (*error) return (*error)->status;
-    const auto since = sinceIn(doc);
     auto fresh = waiterFor(r, c, std::move(trees));
     auto* id = static_cast<uint64_t*>(apr_pcalloc(r->pool, sizeof(uint64_t)));
     Waiter* w = fresh.get();
     const int status =
-        waiters->add(std::move(fresh), since ? newsRing()->positionOf(*since) : std::nullopt, since.has_value());
+        waiters->add(std::move(fresh), body.since ? newsRing()->positionOf(*body.since) : std::nullopt, body.since.has_value());
     if (status == HTTP_TOO_MANY_REQUESTS) return fails(status, "Too many requests of yours wait for news already.");
     if (status != HTTP_OK) return fails(status, "No more requests can wait for news here now.");
     *id = w->id;

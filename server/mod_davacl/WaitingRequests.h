@@ -9,9 +9,7 @@ namespace rolvane::davacl {
 //
 // httpd has no call that gives a suspended connection back to its MPM. So a waiting connection ends with its answer.
 
-inline constexpr const char* kNewsReport = "news"; // in kOwnNamespace
 
-bool isNewsReport(const apr_xml_doc* doc);
 std::string newsReportElement(); // of DAV:supported-report-set
 // What the hook of mod_dav returns for that report. After OK the request waits, and its handler must return what
 // `handedOver` makes of its answer.

@@ -2,7 +2,9 @@
 #include "foundation/Paths.h"
 
 #include <cstdlib>
+#include <filesystem>
 #include <gtest/gtest.h>
+#include <map>
 #include <random>
 
 // Bodies of reports, and If headers, with damage of all kinds, sent to httpd whose mod_davacl watches its own memory:
@@ -61,7 +63,17 @@ const std::vector<std::string> kReports = {
     R"(<D:principal-match xmlns:D="DAV:"><D:self/><D:prop><D:displayname/></D:prop></D:principal-match>)",
     R"(<D:principal-property-search xmlns:D="DAV:"><D:apply-to-principal-collection-set/><D:property-search><D:prop><D:displayname/></D:prop>)"
     R"(<D:match>alice</D:match></D:property-search><D:prop><D:displayname/></D:prop></D:principal-property-search>)",
-    R"(<D:principal-search-property-set xmlns:D="DAV:"/>)"};
+    R"(<D:principal-search-property-set xmlns:D="DAV:"/>)",
+    R"(<D:sync-collection xmlns:D="DAV:"><D:sync-token/><D:sync-level>infinite</D:sync-level><D:limit><D:nresults>2</D:nresults></D:limit>)"
+    R"(<D:prop><D:getetag/><x xmlns="urn:a&amp;b"/></D:prop></D:sync-collection>)",
+    R"(<D:sync-collection xmlns:D="DAV:"><D:sync-token>urn:x-rolvane:tree:d:1a:2b:3:17c0:ff:1:2:1</D:sync-token><D:sync-level>1</D:sync-level>)"
+    R"(<D:prop><D:acl/><D:getetag/></D:prop></D:sync-collection>)",
+    R"(<R:news xmlns:R="http://rolvane.net/ns/" xmlns:D="DAV:"><D:href>/dav/alice/Contacts/</D:href><D:href>/dav/alice/</D:href>)"
+    R"(<D:href>http://localhost/dav/sam/</D:href><R:since>3f5a0b1c22d94e6780aa61c5d7e8f902</R:since></R:news>)"};
+
+bool mayBeNews(const std::string& body) {
+    return body.find("news") != std::string::npos;
+}
 
 class DamagedRequests : public testing::Test {
 protected:
@@ -71,6 +83,23 @@ protected:
     }
     static constexpr unsigned kRounds = 600;
     static constexpr const char* kSecret = "told-to-nobody-else";
+    // The answer to a report of news ends with its connection: the first lines are enough.
+    RawAnswer report(const std::string& user, const std::string& place, const std::string& body) {
+        if (!mayBeNews(body)) return world.ask(user, "REPORT", place, {}, body);
+        RawLines lines(world.port(), {user, "REPORT", place, {}, body});
+        RawAnswer answer;
+        answer.status = lines.status();
+        if (answer.status == 200) answer.body = lines.line().value_or("");
+        return answer;
+    }
+    // Everything in alice's trees, as it lies on the disk.
+    std::map<std::string, std::string> allOfAlice() const {
+        std::map<std::string, std::string> all;
+        const std::filesystem::path trees = world.store.stateDirectory() + "/root/dav/alice";
+        for (const auto& each : std::filesystem::recursive_directory_iterator(trees))
+            all[each.path()] = each.is_directory() ? "" : readFile(each.path());
+        return all;
+    }
     AccessWorld world;
     Damage damage;
 };
@@ -83,7 +112,7 @@ TEST_F(DamagedRequests, NoReportTellsMoreThanItMayOrEndsTheServer) {
         const std::string body = damage.of(damage.oneOf(kReports));
         const std::string& place = damage.oneOf(places);
         for (const char* user : {"rita", "sam"}) {
-            const RawAnswer answer = world.ask(user, "REPORT", place, {}, body);
+            const RawAnswer answer = report(user, place, body);
             ASSERT_NE(answer.status, 0) << body;
             answered += answer.status == 207;
             // 501: mod_dav knows no such report.
@@ -122,6 +151,53 @@ TEST_F(DamagedRequests, NoIfHeaderWritesPastALockOrAList) {
     const std::string real = "(<" + token + ">)";
     EXPECT_EQ(world.status("walter", "PUT", "/dav/alice/secret", {{"If", real}}, "x"), 403) << "a token is no right";
     EXPECT_EQ(world.status("alice", "PUT", "/dav/alice/secret", {{"If", real}}, "x"), 204) << "the lock is another one";
+}
+
+// A stranger spells places of somebody else in every way, as the target of a request and as the Destination of one.
+TEST_F(DamagedRequests, NoPathLeadsAStrangerToWhatIsAlices) {
+    const std::vector<std::string> paths = {"/dav/alice/secret",
+                                            "/dav/sam/../alice/secret",
+                                            "/dav/sam/%2e%2e/alice/%73ecret",
+                                            "/dav/sam/..%2falice%2fsecret",
+                                            "//dav//alice/./secret",
+                                            "/dav/alice%00/secret",
+                                            "/principals/../dav/alice/Contacts/",
+                                            "http://localhost/dav/alice/secret",
+                                            "/dav/sam/x;/../../alice/secret?x#y",
+                                            "/dav/sam/%c0%ae%c0%ae/alice/secret",
+                                            "/DAV/Alice/secret",
+                                            "/dav/sam/own"};
+    const std::vector<std::string> methods = {"GET",  "PUT",  "DELETE", "PROPFIND", "PROPPATCH", "MKCOL",
+                                              "COPY", "MOVE", "LOCK",   "ACL",      "REPORT",    "OPTIONS"};
+    const auto before = allOfAlice();
+    ASSERT_TRUE(before.size() > 3);
+    unsigned refused = 0;
+    for (unsigned i = 0; i < number("ROLVANE_TEST_ROUNDS", kRounds); ++i) {
+        const auto path = [&] {
+            std::string text = damage.of(damage.oneOf(paths));
+            std::erase_if(text, [](char c) { return c == '\n' || c == '\r' || c == ' ' || c == '\t'; });
+            return text.empty() ? std::string("/") : text;
+        };
+        const std::string& method = damage.oneOf(methods);
+        const bool two = method == "COPY" || method == "MOVE";
+        const std::string target = path(), destination = two ? path() : std::string();
+        std::vector<std::pair<std::string, std::string>> headers;
+        if (two) headers = {{"Destination", destination}, {"Overwrite", "T"}};
+        const bool hasBody = method != "GET" && method != "DELETE" && method != "MKCOL" && !two;
+        const std::string body = !hasBody          ? ""
+                                 : method == "ACL" ? AccessWorld::acl(AccessWorld::ace(AccessWorld::user("sam"), "all"))
+                                 : method == "LOCK" ? AccessWorld::kLock
+                                 : method == "PUT" ? "written by a stranger"
+                                                   : AccessWorld::propfind("<D:getetag/>");
+        const RawAnswer answer = world.ask("sam", method, target, headers, body);
+        const std::string what = method + " " + target + (two ? " to " + destination : "");
+        ASSERT_NE(answer.status, 0) << what;
+        EXPECT_TRUE(answer.status < 500 || answer.status == 501 || answer.status == 502) << answer.status << " to " << what;
+        EXPECT_EQ(answer.body.find(kSecret), std::string::npos) << what;
+        refused += answer.status == 403;
+    }
+    EXPECT_GT(refused, 0u) << "no request came near";
+    EXPECT_EQ(allOfAlice(), before);
 }
 
 } // namespace

@@ -155,6 +155,22 @@ TEST_F(Reports, ExpandPropertyQuotesTheNamespacesThatItIsAskedFor) {
     }
 }
 
+TEST_F(Reports, NamesStandInAnswersAsTheyWereAskedFor) {
+    const std::string quoted = "<D:prop><x xmlns=\"urn:a&amp;b\"/></D:prop>", twoColons = "<D:prop><D:a:b/></D:prop>";
+    const auto find = [](const std::string& prop) {
+        return world->ask("rita", "PROPFIND", "/principals/users/rita", {{"Depth", "0"}},
+                          "<D:propfind xmlns:D=\"DAV:\">" + prop + "</D:propfind>");
+    };
+    const auto match = [](const std::string& prop) {
+        return report("rita", "/principals/", "principal-match", "<D:self/>" + prop);
+    };
+    EXPECT_THAT(body(match(quoted)), HasSubstr("xmlns=\"urn:a&amp;b\""));
+    EXPECT_THAT(body(find(quoted)), HasSubstr("xmlns=\"urn:a&amp;b\""));
+    EXPECT_EQ(match(twoColons).status, 400);
+    EXPECT_EQ(find(twoColons).status, 400);
+    EXPECT_EQ(report("rita", kTree, "sync-collection", "<D:sync-token/>" + twoColons).status, 400);
+}
+
 TEST_F(Reports, ExpandPropertyHasBounds) {
     std::string deep = "<D:property name=\"displayname\"/>";
     for (int i = 0; i < 9; ++i) deep = "<D:property name=\"principal-URL\">" + deep + "</D:property>";
