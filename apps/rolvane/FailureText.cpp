@@ -1,5 +1,7 @@
 #include "FailureText.h"
 
+#include "AskAgain.h"
+
 #include "engine/pass/StoreFailures.h"
 #include "store/dav/CXDAVManager.h"
 
@@ -142,8 +144,10 @@ std::optional<PassFailure> testStore() {
     return failure;
 }
 
-void requireStore(const std::string& nothingDone) {
-    const auto failure = testStore();
+void requireStore(Context& context, const std::string& nothingDone) {
+    AskAgain again(context);
+    auto failure = testStore();
+    while (failure && again.after(*failure)) failure = testStore();
     if (!failure) return;
     const FailureText text = failureText(*failure, sceneOfTheAccount(Clock::system().now()));
     throw CommandError(text.code, text.what + " " + text.toDo + " " + nothingDone);

@@ -37,8 +37,9 @@ FailureScene sceneOfTheAccount(Date at);
 
 // Asks the store now. Nothing: it can be used.
 std::optional<PassFailure> testStore();
-// The same, as the error that a command ends with; `nothingDone` stands at its end.
-void requireStore(const std::string& nothingDone);
+// The same, with some patience where it may be over in a moment, as the error that a command ends with; `nothingDone`
+// stands at its end.
+void requireStore(Context& context, const std::string& nothingDone);
 
 // The error of a store that cannot be used; `consequence` follows the reason, as a sentence.
 CommandError hinderedBy(const StoreTrial::Hindrance& hindrance, const std::string& consequence);

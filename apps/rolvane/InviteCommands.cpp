@@ -38,7 +38,7 @@ std::string authorityFingerprint(const CXDAVAccount& account) {
 void invite(Context& context, const InviteOptions& options) {
     const auto account = CXDAVAccount::load();
     if (!account) throw noAccount();
-    requireStore("Nobody was invited.");
+    requireStore(context, "Nobody was invited.");
     Invitation invitation;
     invitation.endpoint = account->secureEndpoint.empty() ? account->endpoint : account->secureEndpoint;
     invitation.user = options.user;

@@ -65,8 +65,8 @@ Json orNull(const std::optional<Date>& date) {
 }
 
 // Refuses where the store cannot do what is asked.
-void requireAccessLists(const Url& base, const std::string& user) {
-    requireStore("Nothing was changed.");
+void requireAccessLists(Context& context, const Url& base, const std::string& user) {
+    requireStore(context, "Nothing was changed.");
     const auto keeps = CXDAVManager::defaultManager().keepsAccessLists();
     if (!keeps)
         throw CommandError(kUnreachable, "The store does not say whether it keeps access lists. Nothing was changed; "
@@ -192,7 +192,7 @@ void changeShares(Context& context, const ShareOptions& options, bool grant) {
         return;
     }
     if (options.dryRun) return tellSharing(context, options, user);
-    requireAccessLists(base, user);
+    requireAccessLists(context, base, user);
 
     const std::vector<std::string> writers = shares.writers();
     const bool takesBack = !grant || !options.write;
@@ -280,7 +280,7 @@ void showRights(Context& context, const std::string& named) {
     (void)ownBase();
     const RemoteLocation location = namedLocation(named);
     const std::string user = publisherOf(location);
-    requireStore("What you may do there is not known.");
+    requireStore(context, "What you may do there is not known.");
     const AccountOwner owner;
     bool read = false, write = false;
     const bool own = owner.userForRemoteLocation(location) == kSelf;

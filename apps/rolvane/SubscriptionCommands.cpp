@@ -1,3 +1,4 @@
+#include "AskAgain.h"
 #include "Consent.h"
 #include "Context.h"
 #include "Counted.h"
@@ -37,13 +38,18 @@ struct SubscribeOptions {
 };
 
 // Asks the store whether there is something that may be read, and says clearly why not.
-void requirePublication(const RemoteLocation& location) {
+void requirePublication(Context& context, const RemoteLocation& location) {
     const std::string user = publisherOf(location), self = CXDAVManager::vaultraUser();
-    int code = 0;
     const Url info = Url(location.str()).cxURLByAppendingComponent(layout::kInfo);
-    if (CXDAVManager::defaultManager().dictionaryAtURL(info, false, &code)) return;
-    const std::vector<PassFailure> requests = takeFailures(CXDAVManager::defaultManager());
-    requireStore("Nothing was subscribed to.");
+    CXDAVManager& store = CXDAVManager::defaultManager();
+    AskAgain again(context);
+    int code = 0;
+    std::vector<PassFailure> requests;
+    do {
+        if (store.dictionaryAtURL(info, false, &code)) return;
+        requests = takeFailures(store);
+        requireStore(context, "Nothing was subscribed to.");
+    } while (code != kForbidden && code != kMissing && !requests.empty() && again.after(requests.back()));
     if (code == kForbidden)
         throw CommandError(kRefused, fmt::format("The store does not let you read the contacts of \"{0}\". Check the "
                                                  "name, or ask for the right to read: `rolvane share {1}`, typed by "
@@ -102,9 +108,15 @@ void waitForPeople(Context& context, PassWatch& watch, OutcomeWatch& outcomes, c
         const PassTree* tree = outcome.tree(UserName(user));
         return isComplete(outcome) && tree && tree->in.reached && tree->in.waiting == 0;
     };
-    // The pass may have carried changes alone, or may have been ended in the middle by the restart.
-    const auto goesOn = [&] { return outcome.storeReached && database.findSubscriptionWithRemoteLocation(location); };
-    for (int again = 0; again < 2 && !cameWhole() && goesOn(); ++again) outcome = makePass(context, seconds);
+    // The pass may have carried changes alone, or may have been ended in the middle by the restart. Or the store was
+    // too busy for it: many may have begun at this moment.
+    AskAgain again(context);
+    for (int passes = 0; !cameWhole() && database.findSubscriptionWithRemoteLocation(location); ++passes) {
+        const PassTree* tree = outcome.tree(UserName(user));
+        const auto why = tree && tree->in.why ? tree->in.why : firstFailure(outcome);
+        if (!(why && again.after(*why)) && (passes >= 2 || !outcome.storeReached)) break;
+        outcome = makePass(context, seconds);
+    }
     const CXSubscriptionRef subscription = database.findSubscriptionWithRemoteLocation(location);
     if (!subscription)
         throw CommandError(kRefused, fmt::format("The store let go of the contacts of \"{}\" while they were fetched: "
@@ -152,7 +164,7 @@ void subscribe(Context& context, const SubscribeOptions& options) {
         throw CommandError(kRefused, fmt::format("You are subscribed to \"{}\" already. `rolvane sync` brings what is "
                                                  "new, `rolvane subscriptions` tells how it stands.",
                                                  user));
-    requirePublication(location);
+    requirePublication(context, location);
     if (options.dryRun) return tellSubscribing(context, location);
 
     const bool served = Publication(database).anything() || !subscriptionsToPeople(database).empty();

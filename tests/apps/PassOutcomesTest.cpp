@@ -3,6 +3,7 @@
 #include "FaultyStore.h"
 #include "Neighbour.h"
 
+#include <atomic>
 #include <filesystem>
 #include <fstream>
 #include <functional>
@@ -56,6 +57,58 @@ protected:
     }
     CommandWorld world;
 };
+
+// Which requests are refused, and how often, before all are let through.
+struct Busy {
+    const char *path, *method;
+    int status;
+    const char* headers;
+};
+
+TEST_F(Outcomes, ASubscriptionWaitsForAStoreThatIsBusyForAMoment) {
+    world.done({"publish"});
+    FaultyStore faulty(world.store());
+    Neighbour bob(world, "bob");
+    world.done({"share", "bob"});
+    bob.done(faulty.account());
+    const Busy cases[] = {{"/alice/Contacts/info", "GET", 503, ""},   // the first question
+                          {"", "", 503, ""},                          // all of them
+                          {"", "", 0, ""},                            // each connection ends
+                          {"/alice/Contacts/", "PROPFIND", 503, ""}}; // a listing, in the daemon's pass
+    for (const Busy& busy : cases) {
+        std::atomic<int> refused = 0;
+        faulty.set([&](const FakeRequest& request) -> std::optional<FakeAnswer> {
+            constexpr int kOften = 3; // requests are repeated by themselves once
+            const bool meant = request.target.find(busy.path) != std::string::npos &&
+                               (*busy.method == 0 || request.method == busy.method);
+            if (!meant || refused >= kOften) return std::nullopt;
+            ++refused;
+            return busy.status ? FakeAnswer::status(busy.status, "", busy.headers) : FakeAnswer::raw({});
+        });
+        const Ran ran = bob.rolvane({"subscribe", "alice"});
+        EXPECT_EQ(ran.status, kDone) << busy.path << " " << busy.status << "\n" << ran;
+        EXPECT_TRUE(says(ran, "asked again in")) << busy.path << " " << busy.status << "\n" << ran;
+        EXPECT_EQ(refused, 3);
+        EXPECT_EQ(bob.json({"list"}).size(), 1U);
+        bob.done({"unsubscribe", "alice"});
+        bob.done({"daemon", "stop"});
+        faulty.set({});
+    }
+}
+
+TEST_F(Outcomes, ASubscriptionDoesNotWaitForAnAnswerThatLasts) {
+    world.done({"publish"});
+    FaultyStore faulty(world.store());
+    Neighbour bob(world, "bob");
+    bob.done(faulty.account());
+    for (const int status : {500, 507}) {
+        faulty.answerAll(status, "no");
+        const Ran ran = bob.rolvane({"subscribe", "alice"});
+        EXPECT_NE(ran.status, kDone) << ran;
+        EXPECT_FALSE(says(ran, "asked again in")) << ran;
+        EXPECT_TRUE(says(ran, "Nothing was subscribed to")) << ran;
+    }
+}
 
 TEST_F(Outcomes, ASyncOfASubscriberSaysWhyTheStoreWasNotReached) {
     world.done({"publish"});
