@@ -51,8 +51,8 @@ inline void checkSync(const apr_xml_doc* doc) {
         throw std::logic_error("a token reads back as another");
 }
 
-// Any body of a REPORT: every report of the module reads it, whichever it is. Throws std::logic_error when a promise does
-// not hold that the answers rely on.
+// Any body of a REPORT: every report of the module reads it, whichever it is. Throws std::logic_error when a promise
+// does not hold that the answers rely on.
 inline void checkReportBody(const uint8_t* data, size_t size) {
     const AprPool pool;
     const apr_xml_doc* doc = readXml(pool, data, size);

@@ -1,6 +1,7 @@
 #include "server/mod_davacl/Access.h"
 
 #include "server/mod_davacl/GroupFile.h"
+#include "server/mod_davacl/Uploads.h"
 
 #include <fstream>
 #include <sstream>
@@ -147,6 +148,7 @@ int refuse(request_rec* r, const Configuration& c, const Missing& missing) {
     error->childtags = apr_pstrdup(r->pool, children.c_str());
     ap_log_rerror(APLOG_MARK, APLOG_INFO, 0, r, "davacl: %s (%s)", what, r->uri);
     r->status = HTTP_FORBIDDEN;
+    boundUpload(r);
     ap_discard_request_body(r);
     return dav_handle_err(r, error, nullptr);
 }

@@ -137,6 +137,15 @@ const char* setNewcomers(cmd_parms* cmd, void*, const char* text) {
     return readNumber(text, 100000, into) ? nullptr : "the number of connections must be from 0 to 100000";
 }
 
+const char* setUploads(cmd_parms* cmd, void*, const char* text) {
+    int& into = ofServer(cmd->server)->uploads;
+    if (std::strcmp(text, "0") == 0) {
+        into = 0;
+        return nullptr;
+    }
+    return readNumber(text, 100000, into) ? nullptr : "the number of requests must be from 0 to 100000";
+}
+
 const char* setNews(cmd_parms* cmd, void*, int on) {
     ofServer(cmd->server)->news = on;
     return nullptr;
@@ -216,6 +225,11 @@ int mostNewcomers(const server_rec* server) {
     return c && c->newcomers > 0 ? c->newcomers : 0;
 }
 
+size_t uploadsOfUser(const server_rec* server) {
+    const Configuration* c = ofServer(server);
+    return c && c->uploads > 0 ? static_cast<size_t>(c->uploads) : 0;
+}
+
 bool givesNews(const server_rec* server) {
     const Configuration* c = ofServer(server);
     return c && c->base && c->news > 0;
@@ -258,6 +272,7 @@ void* mergeConfigurations(apr_pool_t* pool, void* base, void* more) {
     if (inner->strict >= 0) merged->strict = inner->strict;
     if (inner->parks >= 0) merged->parks = inner->parks;
     if (inner->newcomers >= 0) merged->newcomers = inner->newcomers;
+    if (inner->uploads >= 0) merged->uploads = inner->uploads;
     if (inner->news >= 0) merged->news = inner->news;
     if (inner->newsOfUser) merged->newsOfUser = inner->newsOfUser;
     if (inner->heartbeat) merged->heartbeat = inner->heartbeat;
@@ -351,6 +366,8 @@ const command_rec kDirectives[] = {
      "a directory in which the date of the file with a user's name tells when that user signed in last"},
     {"DavAclOwnPasswords", asCommand(setOwnPasswords), nullptr, RSRC_CONF, TAKE1,
      "a directory for the passwords that users choose themselves; without it they cannot"},
+    {"DavAclUploadsOfUser", asCommand(setUploads), nullptr, RSRC_CONF, TAKE1,
+     "how many requests of one user may wait for bytes of their bodies in each process"},
     {"DavAclNewcomers", asCommand(setNewcomers), nullptr, RSRC_CONF, TAKE1,
      "how many connections of one address, in one process, may be silent without a sign-in: 0, no bound, by default"},
     {"DavAclNews", asCommand(setNews), nullptr, RSRC_CONF, FLAG,

@@ -3,6 +3,7 @@
 #include "server/mod_davacl/Access.h"
 #include "server/mod_davacl/Locks.h"
 #include "server/mod_davacl/Needs.h"
+#include "server/mod_davacl/Uploads.h"
 
 #include <algorithm>
 #include <cstring>
@@ -67,6 +68,7 @@ int refuseReach(request_rec* r) {
                           "The request takes in all trees, and one of them at least is not yours to do that with.",
                           "DAV:", "need-privileges");
     ap_log_rerror(APLOG_MARK, APLOG_INFO, 0, r, "davacl: %s %s takes in trees of others", r->method, r->uri);
+    boundUpload(r);
     ap_discard_request_body(r);
     return dav_handle_err(r, error, nullptr);
 }
@@ -93,6 +95,7 @@ int check(request_rec* r) {
     // Every sub-request that asks where something lies ends here, too: it is no request of its own.
     if (takesInAll && (!r->main || destination) && reachesIntoForeignTrees(r, *c, destination)) return refuseReach(r);
     if (!place) return DECLINED;
+    if (place->isTooLong()) return HTTP_REQUEST_URI_TOO_LARGE; // else mod_dav would fail in the middle
     if (place->isReserved() || namesConfiguration(r, *place)) return HTTP_FORBIDDEN;
     const Standing standing = standingOf(r);
     const auto missing =

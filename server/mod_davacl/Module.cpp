@@ -11,6 +11,7 @@
 #include "server/mod_davacl/Passwords.h"
 #include "server/mod_davacl/PrincipalResources.h"
 #include "server/mod_davacl/Reports.h"
+#include "server/mod_davacl/Uploads.h"
 #include "server/mod_davacl/WaitingRequests.h"
 
 #include <http_connection.h>
@@ -42,6 +43,9 @@ void registerHooks(apr_pool_t* pool) noexcept {
     ap_hook_fixups(noteSignIn, nullptr, nullptr, APR_HOOK_REALLY_FIRST - 1);
     ap_hook_log_transaction(noteAnswer, nullptr, nullptr, APR_HOOK_REALLY_FIRST);
     ap_hook_process_connection(parkSilent, nullptr, nullptr, APR_HOOK_REALLY_FIRST);
+    registerUploads();
+    ap_hook_insert_filter(boundUpload, nullptr, nullptr, APR_HOOK_LAST);
+    ap_hook_insert_error_filter(leaveRefusedBody, nullptr, nullptr, APR_HOOK_MIDDLE);
     ap_hook_fixups(enforce, nullptr, nullptr, APR_HOOK_REALLY_FIRST);
     ap_hook_handler(servePrincipals, nullptr, beforeDav, APR_HOOK_FIRST);
     ap_hook_handler(serveAcl, nullptr, beforeDav, APR_HOOK_FIRST);

@@ -8,12 +8,30 @@
 namespace rolvane::davacl {
 namespace {
 
-bool isXmlName(const std::string& name) {
+bool hasNoOtherAscii(const std::string& name) {
     return !name.empty() && !std::strchr("-.0123456789", name[0]) &&
            std::all_of(name.begin(), name.end(), [](unsigned char c) {
                return c >= 0x80 || (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || (c >= '0' && c <= '9') ||
                       c == '-' || c == '.' || c == '_';
            });
+}
+
+// Beyond ASCII the parser that reads answers decides.
+bool isReadable(const std::string& name) {
+    apr_pool_t* pool = nullptr;
+    if (apr_pool_create(&pool, nullptr) != APR_SUCCESS) return false;
+    const std::string element = "<" + name + "/>";
+    apr_xml_parser* parser = apr_xml_parser_create(pool);
+    apr_xml_doc* doc = nullptr;
+    const bool fed = apr_xml_parser_feed(parser, element.data(), element.size()) == APR_SUCCESS;
+    const bool isRead = apr_xml_parser_done(parser, &doc) == APR_SUCCESS && fed;
+    apr_pool_destroy(pool);
+    return isRead;
+}
+
+bool isXmlName(const std::string& name) {
+    const bool isAscii = std::all_of(name.begin(), name.end(), [](unsigned char c) { return c < 0x80; });
+    return hasNoOtherAscii(name) && (isAscii || isReadable(name));
 }
 
 bool isOwn(const apr_xml_doc* doc, const apr_xml_elem* element, const char* name) {
@@ -30,7 +48,7 @@ std::vector<Wanted> namesIn(const apr_xml_doc* doc, const apr_xml_elem* prop) {
 }
 
 bool canBeAnswered(const std::vector<Wanted>& names) {
-    return std::all_of(names.begin(), names.end(), [](const Wanted& each) { return isXmlName(each.name); });
+    return std::all_of(names.begin(), names.end(), [](const Wanted& each) { return hasNoOtherAscii(each.name); });
 }
 
 std::string emptyElement(apr_pool_t* pool, const Wanted& property) {
@@ -49,7 +67,8 @@ std::optional<PrincipalMatch> parsePrincipalMatch(const apr_xml_doc* doc, const 
 std::optional<std::vector<PropertySearch>> parseSearches(const apr_xml_doc* doc, const char*& problem) {
     std::vector<PropertySearch> searches;
     for (const apr_xml_elem* e = doc->root->first_child; e; e = e->next)
-        if (isDav(e, "property-search")) searches.push_back({namesIn(doc, child(e, "prop")), textOf(child(e, "match"))});
+        if (isDav(e, "property-search"))
+            searches.push_back({namesIn(doc, child(e, "prop")), textOf(child(e, "match"))});
     problem = nullptr;
     if (searches.empty() || std::any_of(searches.begin(), searches.end(), [](const PropertySearch& s) {
             return s.properties.empty() || s.match.empty();

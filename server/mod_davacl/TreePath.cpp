@@ -64,6 +64,12 @@ bool TreePath::isReserved() const {
     return isReservedSegment(owner) || std::any_of(below.begin(), below.end(), isReservedSegment);
 }
 
+bool TreePath::isTooLong() const {
+    constexpr size_t kLongestSegment = 255;
+    const auto isLong = [](const std::string& segment) { return segment.size() > kLongestSegment; };
+    return isLong(owner) || std::any_of(below.begin(), below.end(), isLong);
+}
+
 bool isAbove(std::string_view base, std::string_view path) {
     while (path.ends_with('/')) path.remove_suffix(1);
     return path.size() < base.size() && base.starts_with(path) && base[path.size()] == '/';

@@ -24,6 +24,8 @@ struct TreePath {
     bool isWithin(const TreePath& other) const; // below it, or the same place
     // A segment that httpd or its file store keep for themselves (".htaccess" and the like, ".DAV"), in any case.
     bool isReserved() const;
+    // A segment that no file system holds: it has more than 255 bytes.
+    bool isTooLong() const;
 };
 
 // Whether the path is one of those on the way down to the base, "/" for instance; the base itself is none.

@@ -514,8 +514,8 @@ int waitForNews(request_rec* r, const Configuration& c, const apr_xml_doc* doc, 
     auto fresh = waiterFor(r, c, std::move(trees));
     auto* id = static_cast<uint64_t*>(apr_pcalloc(r->pool, sizeof(uint64_t)));
     Waiter* w = fresh.get();
-    const int status =
-        waiters->add(std::move(fresh), body.since ? newsRing()->positionOf(*body.since) : std::nullopt, body.since.has_value());
+    const int status = waiters->add(std::move(fresh), body.since ? newsRing()->positionOf(*body.since) : std::nullopt,
+                                    body.since.has_value());
     if (status == HTTP_TOO_MANY_REQUESTS) return fails(status, "Too many requests of yours wait for news already.");
     if (status != HTTP_OK) return fails(status, "No more requests can wait for news here now.");
     *id = w->id;

@@ -9,7 +9,6 @@ namespace rolvane::davacl {
 //
 // httpd has no call that gives a suspended connection back to its MPM. So a waiting connection ends with its answer.
 
-
 std::string newsReportElement(); // of DAV:supported-report-set
 // What the hook of mod_dav returns for that report. After OK the request waits, and its handler must return what
 // `handedOver` makes of its answer.

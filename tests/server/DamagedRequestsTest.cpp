@@ -187,12 +187,13 @@ TEST_F(DamagedRequests, NoPathLeadsAStrangerToWhatIsAlices) {
         const std::string body = !hasBody          ? ""
                                  : method == "ACL" ? AccessWorld::acl(AccessWorld::ace(AccessWorld::user("sam"), "all"))
                                  : method == "LOCK" ? AccessWorld::kLock
-                                 : method == "PUT" ? "written by a stranger"
-                                                   : AccessWorld::propfind("<D:getetag/>");
+                                 : method == "PUT"  ? "written by a stranger"
+                                                    : AccessWorld::propfind("<D:getetag/>");
         const RawAnswer answer = world.ask("sam", method, target, headers, body);
         const std::string what = method + " " + target + (two ? " to " + destination : "");
         ASSERT_NE(answer.status, 0) << what;
-        EXPECT_TRUE(answer.status < 500 || answer.status == 501 || answer.status == 502) << answer.status << " to " << what;
+        EXPECT_TRUE(answer.status < 500 || answer.status == 501 || answer.status == 502)
+            << answer.status << " to " << what;
         EXPECT_EQ(answer.body.find(kSecret), std::string::npos) << what;
         refused += answer.status == 403;
     }

@@ -152,6 +152,25 @@ TEST(DirectedAttacks, AnOldNameOfDestinationIsNoWayAroundTheLists) {
     EXPECT_TRUE(std::filesystem::is_empty(world.store.userDirectory("sam") + "/in"));
 }
 
+TEST(DirectedAttacks, NamesThatNoFileSystemHoldsAreRefusedAsTooLong) {
+    const AccessWorld world;
+    world.reset();
+    const std::string name(256, 'n'), place = "/dav/alice/" + name;
+    ASSERT_EQ(world.status("alice", "PUT", "/dav/alice/x", {}, "x"), 201);
+    const auto refuses = [&](const std::string& method, const std::string& target, const std::string& destination) {
+        const int status = world.status("alice", method, target, {{"Destination", destination}});
+        EXPECT_TRUE(status == 403 || status == 414) << status << " to " << method << " " << target.substr(0, 20);
+    };
+    // httpd itself looks no further than to the first collection that is not there.
+    for (const std::string& target : {place, place + "/x", "/dav/alice/none/" + name + "/x"}) {
+        for (const char* method : {"GET", "PUT", "DELETE", "MKCOL", "PROPFIND", "LOCK", "COPY"})
+            refuses(method, target, "/dav/alice/y");
+        for (const char* method : {"COPY", "MOVE"}) refuses(method, "/dav/alice/x", target);
+    }
+    EXPECT_EQ(world.status("alice", "PUT", "/dav/alice/" + name.substr(1), {}, "x"), 201) << "that is the longest";
+    EXPECT_EQ(world.status("alice", "GET", "/dav/alice/x"), 200);
+}
+
 TEST(DirectedAttacks, AnEntryWithTwoOfWhatItHasOneOfIsRefused) {
     const AccessWorld world;
     world.reset();

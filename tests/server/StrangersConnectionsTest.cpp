@@ -202,6 +202,73 @@ TEST(SlowUploads, CloseNobodysKeptConnection) {
     }
 }
 
+// One user's bodies that do not come hold a part of the threads, and the others serve whoever else asks.
+TEST(SlowUploads, OfOneUserLeaveThreadsToOthers) {
+    constexpr int kUploads = 12, kThreads = 8;
+    const StoreDirectory directory;
+    PrivateStoreOptions options = optionsIn(directory);
+    options.threadsPerProcess = kThreads;
+    options.maximumProcesses = 1;
+    options.extraConfiguration = {"RequestReadTimeout body=600"};
+    PrivateStore store(options);
+    store.addUser("alice", "word");
+    store.addUser("bob", "word");
+    store.start();
+    const CurlClient bob(store, "bob", "word");
+    ASSERT_EQ(bob.request("PUT", "/bob/x", {}, "x").status, 201);
+    const std::string signIn = " HTTP/1.1\r\nHost: localhost\r\nAuthorization: Basic YWxpY2U6d29yZA==\r\n";
+    std::vector<std::unique_ptr<TLSConnection>> uploads;
+    for (int i = 0; i < kUploads; ++i) {
+        uploads.push_back(std::make_unique<TLSConnection>(store.status().port));
+        // In turns: of the own tree, and of another's, which is refused before its body.
+        const std::string path = i % 2 ? "PUT /dav/alice/f" + std::to_string(i) : "PUT /dav/bob/f";
+        uploads.back()->write(path + signIn + "Content-Length: 2\r\n\r\n");
+    }
+    EXPECT_EQ(bob.request("GET", "/bob/x").status, 200);
+    int late = 0;
+    for (int i = 1; i < kUploads; i += 2) {
+        uploads[static_cast<size_t>(i)]->write("ab");
+        const auto answer = uploads[static_cast<size_t>(i)]->answers(1);
+        ASSERT_EQ(answer.size(), 1u) << i;
+        EXPECT_TRUE(answer[0] == 201 || answer[0] == 408) << answer[0];
+        late += answer[0] == 408;
+    }
+    const CurlClient alice(store, "alice", "word");
+    EXPECT_EQ(alice.request("PUT", "/alice/x", {}, "x").status, 201);
+    std::printf("%d of %d ended with 408\n", late, kUploads / 2);
+}
+
+// Nobody waits for the body of a request that is answered with 401 anyway.
+TEST(SlowUploads, OfAStrangerHoldNoThread) {
+    constexpr int kUploads = 20, kThreads = 8;
+    const StoreDirectory directory;
+    PrivateStoreOptions options = optionsIn(directory);
+    options.threadsPerProcess = kThreads;
+    options.maximumProcesses = 1;
+    options.extraConfiguration = {"RequestReadTimeout body=600"};
+    PrivateStore store(options);
+    store.addUser("bob", "word");
+    store.start();
+    const CurlClient bob(store, "bob", "word");
+    ASSERT_EQ(bob.request("PUT", "/bob/x", {}, "x").status, 201);
+    std::vector<std::unique_ptr<TLSConnection>> uploads;
+    for (int i = 0; i < kUploads; ++i) {
+        uploads.push_back(std::make_unique<TLSConnection>(store.status().port));
+        // Without a password, with a wrong one, and to a place that is none of a user's.
+        const char* heads[] = {"PUT /dav/bob/f HTTP/1.1\r\n",
+                               "PUT /dav/bob/f HTTP/1.1\r\nAuthorization: Basic Ym9iOm5vbmU=\r\n",
+                               "POST /elsewhere HTTP/1.1\r\n"};
+        uploads.back()->write(heads[i % 3] + std::string("Host: localhost\r\nContent-Length: 200000\r\n\r\n"));
+    }
+    EXPECT_EQ(bob.request("GET", "/bob/x").status, 200);
+    for (auto& each : uploads) EXPECT_EQ(each->answers(1).size(), 1u);
+    // A body that is there is read, and the connection goes on.
+    TLSConnection kept(store.status().port);
+    const std::string whole = "PUT /dav/bob/f HTTP/1.1\r\nHost: localhost\r\nContent-Length: 2\r\n\r\nab";
+    kept.write(whole + whole);
+    EXPECT_EQ(kept.answers(2), (std::vector<int>{401, 401}));
+}
+
 // More than the whole server can hold at a time.
 TEST_P(SilentStrangers, OfOneAddressGiveWayToOthersWhenTheyAreTooMany) {
     const StoreDirectory directory;
