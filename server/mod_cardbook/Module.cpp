@@ -27,6 +27,9 @@ const dav_resource_type_provider kTypes = {resourceType};
 // A body that is no card is read whole by httpd, which asks its own limit (LimitXMLRequestBody).
 int boundBodies(request_rec* r) noexcept {
     if (!servesBooks(r)) return DECLINED;
+    // mod_dav has the provider read and compare lock tokens without asking whether it has locks: a worker would end
+    // there. Conditions on tags stand in If-Match.
+    if (apr_table_get(r->headers_in, "If")) return HTTP_PRECONDITION_FAILED;
     auto* core = static_cast<core_dir_config*>(ap_get_core_module_config(r->per_dir_config));
     core->limit_xml_body = configurationOf(r).reportBytes();
     return DECLINED;

@@ -167,8 +167,8 @@ TEST_F(Rights, OfAUserWhomTheStoreDoesNotKnowTheOwnerLearns) {
 TEST_F(Rights, WhileTheStoreIsAwayNothingIsChanged) {
     world.done({"publish"});
     world.store().stop(PrivateStore::Stop::atOnce);
-    EXPECT_TRUE(saysOnce(world.rolvane({"share", "bob"}), kNotReached, "Nothing was changed"));
-    EXPECT_TRUE(saysOnce(bob.rolvane({"rights", "alice"}), kNotReached, ""));
+    EXPECT_TRUE(saysOnce(world.rolvane({"share", "bob", "--quiet"}), kNotReached, "Nothing was changed"));
+    EXPECT_TRUE(saysOnce(bob.rolvane({"rights", "alice", "--quiet"}), kNotReached, ""));
     world.store().start();
     EXPECT_EQ(world.json({"shares"}), nlohmann::json::array());
 }

@@ -255,6 +255,21 @@ TEST(Delete, TakesAPersonAwayUnlessTheCardHasChanged) {
         EXPECT_EQ(world.ask("DELETE", collection).status, 403) << collection;
 }
 
+TEST(Books, HaveNoLocksSoNoIfHeaderIsEverMet) {
+    BooksWorld world;
+    const auto ann = world.addPerson("Ann", "Lee");
+    const std::string path = at(BooksWorld::uuidOf(ann) + ".vcf");
+    for (const char* header : {"(<x:1>)", "(Not <DAV:no-lock>)", "([\"a\"] <x:1>)", "</books/> (<x:1>)", "(<x:1"})
+        for (const char* method : {"DELETE", "PUT", "MOVE", "LOCK", "PROPPATCH"})
+            for (const std::string& target : {path, std::string("/books/home/")})
+                EXPECT_EQ(world.ask(method, target, {{"If", header}}).status, 412) << method << " " << header;
+    const std::string tag = world.ask("GET", path).tag();
+    for (const std::string& each : {std::string("\"other\""), tag})
+        EXPECT_EQ(world.ask("DELETE", path, {{"If", "([" + each + "])"}}).status, 412);
+    EXPECT_TRUE(ann->isAttached());
+    EXPECT_EQ(world.ask("DELETE", path, {{"If-Match", tag}}).status, 204);
+}
+
 TEST(Collections, AreNotMadeNorChangedHere) {
     BooksWorld world;
     const Unchanged unchanged(world);
