@@ -109,6 +109,9 @@ public:
         return applyChangeRecordIfNeeded(record, nullptr);
     }
 
+    // The next gathering makes the same change by itself, for as long as it is to be made. Base: no.
+    virtual bool findsAgain(const CXDChangeRecord& /*record*/) const { return false; }
+
     // The pass has been stored, or could not be: what the source has given in it is in the contact database, or not.
     virtual void passWasStored() {}
     virtual void passWasNotStored() {}

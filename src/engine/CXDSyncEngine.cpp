@@ -238,8 +238,9 @@ CXDChangeRecords CXDSyncEngine::gather() {
         _parts->outcomes.caught(e.reason());
         unlockAllURLs();
     }
+    const auto findsAgain = [&](const CXDChangeRecord& record) { return conduits.vaultra->findsAgain(record); };
     _parts->state.withConduitData(
-        [&](Dictionary& data) { holdBackRefusedChanges(data, gathered, _parts->with.clock.now()); });
+        [&](Dictionary& data) { holdBackRefusedChanges(data, gathered, findsAgain, _parts->with.clock.now()); });
     return gathered;
 }
 

@@ -149,21 +149,24 @@ TEST(TreeCondition, AGroupThatIsNowhereIsTakenOutOfTheGroupsThatNameIt) {
     now.set("H:CXGroup", Dictionary{{kMemberUIDState, Array()}, {kSubgroupUIDState, Array{"G:CXGroup"}}});
     const Dictionary alone = namesAlone(before, now, nobody);
     EXPECT_EQ(alone, (Dictionary{{"H:CXGroup", Array{"G:CXGroup"}}}));
-    const CXDChangeRecords removals = removalOfNamesAlone(before, alone);
+    const CXDChangeRecords removals = removalOfNamesAlone(before, alone, {}, kNow);
     ASSERT_EQ(removals.size(), 1u) << "the list named it before";
     EXPECT_EQ(removals[0]->type(), CXDRemoveGroupFromGroup);
     EXPECT_EQ(removals[0]->person(), UniqueId("G:CXGroup"));
     EXPECT_EQ(removals[0]->group(), UniqueId("H:CXGroup"));
-    EXPECT_TRUE(removalOfNamesAlone(now, namesAlone(now, now, nobody)).empty()) << "it may be still to come";
+    EXPECT_TRUE(removalOfNamesAlone(now, namesAlone(now, now, nobody), {}, kNow).empty()) << "it may be still to come";
     Dictionary seen = now;
-    seen.set(kNamesAlone, alone);
-    EXPECT_EQ(removalOfNamesAlone(seen, namesAlone(seen, now, nobody)).size(), 1u) << "it does not come";
+    seen.set(kNamesAlone, namesTogether({}, alone, {}, kNow));
+    EXPECT_TRUE(
+        removalOfNamesAlone(seen, namesAlone(seen, now, nobody), {}, kNow.addingSeconds(kPatience - 1)).empty());
+    EXPECT_EQ(removalOfNamesAlone(seen, namesAlone(seen, now, nobody), {}, kNow.addingSeconds(kPatience)).size(), 1u)
+        << "it does not come";
     EXPECT_TRUE(namesAlone(now, now, [](const UniqueId&) { return true; }).empty()) << "the owner has it";
     now["AllCXGroup"].dictionary().remove(kSubgroupUIDState);
     EXPECT_TRUE(namesAlone(now, now, nobody).empty()) << "single groups are published";
 }
 
-TEST(TreeCondition, ANameOfEverybodysListWithoutAContactIsTakenOutWhenItStandsForTwoVisits) {
+TEST(TreeCondition, ANameOfEverybodysListWithoutAContactIsTakenOutWhenItStandsForAWeek) {
     Dictionary now = tree();
     const auto isHere = [](const UniqueId& uid) { return uid.str() != "gone:CXPerson"; };
     EXPECT_TRUE(namesAlone(now, now, isHere).empty());
@@ -172,14 +175,63 @@ TEST(TreeCondition, ANameOfEverybodysListWithoutAContactIsTakenOutWhenItStandsFo
     now.dictionaryFor("AllCXGroup").set(kMemberUIDState, names);
     const Dictionary alone = namesAlone(tree(), now, isHere);
     EXPECT_EQ(alone, (Dictionary{{"AllCXGroup", Array{"gone:CXPerson"}}}));
-    EXPECT_TRUE(removalOfNamesAlone(now, alone).empty()) << "somebody is deleting it";
+    EXPECT_TRUE(removalOfNamesAlone(now, alone, {}, kNow).empty()) << "somebody is deleting it";
     Dictionary seen = now;
-    seen.set(kNamesAlone, alone);
-    const CXDChangeRecords removals = removalOfNamesAlone(seen, alone);
+    seen.set(kNamesAlone, namesTogether({}, alone, {}, kNow));
+    EXPECT_TRUE(removalOfNamesAlone(seen, alone, {}, kNow.addingSeconds(kPatience - 1)).empty()) << "it may come yet";
+    const CXDChangeRecords removals = removalOfNamesAlone(seen, alone, {}, kNow.addingSeconds(kPatience));
     ASSERT_EQ(removals.size(), 1u);
     EXPECT_EQ(removals[0]->type(), CXDRemoveRecordFromGroup);
     EXPECT_EQ(removals[0]->person(), UniqueId("gone:CXPerson"));
     EXPECT_EQ(removals[0]->group(), UniqueId("AllCXGroup"));
+}
+
+TEST(TreeCondition, WhatAnEarlierVersionRememberedBeginsItsWeekNow) {
+    const Dictionary alone{{"AllCXGroup", Array{"gone:CXPerson"}}};
+    Dictionary seen = tree();
+    seen.set(kNamesAlone, alone); // without dates
+    EXPECT_TRUE(removalOfNamesAlone(seen, alone, {}, kNow).empty());
+    EXPECT_EQ(namesTogether(alone, alone, {}, kNow), (Dictionary{{"AllCXGroup", Dictionary{{"gone:CXPerson", kNow}}}}));
+    const Dictionary circles{{"C:CXGroup", Array{"A:CXGroup"}}};
+    seen.set(kNamesAlone, circles);
+    EXPECT_EQ(removalOfNamesAlone(seen, {}, circles, kNow).size(), 1u);
+}
+
+TEST(TreeCondition, AContactIsUnlistedWhereNoGroupNamesIt) {
+    Dictionary state = tree();
+    const auto unlisted = [&](const std::vector<UniqueId>& candidates = {}) {
+        return contactsThatAreUnlisted(state, candidates);
+    };
+    EXPECT_TRUE(unlisted({UniqueId("a:CXPerson"), UniqueId("nowhere:CXPerson")}).empty());
+    Dictionary people = state[kPeopleState].dictionary()[kMemberUIDState].dictionary();
+    people.set("c:CXPerson", Dictionary{{kModificationDate, kNow}});
+    EXPECT_EQ(unlisted(), std::vector{UniqueId("c:CXPerson")});
+    state["G:CXGroup"].dictionary().set(kMemberUIDState, Array{"c:CXPerson"});
+    EXPECT_TRUE(unlisted().empty()) << "single groups may be published";
+    state["G:CXGroup"].dictionary().set(kMemberUIDState, Array());
+    people.remove("a:CXPerson"); // as many as are listed
+    EXPECT_TRUE(unlisted().empty());
+    EXPECT_EQ(unlisted({UniqueId("c:CXPerson")}), std::vector{UniqueId("c:CXPerson")});
+    state["AllCXGroup"].dictionary().remove(kMemberUIDState);
+    EXPECT_TRUE(unlisted({UniqueId("c:CXPerson")}).empty()) << "no list, no judgement";
+}
+
+TEST(TreeCondition, AGroupThatHasLeftItsOwnersDatabaseAndTheTreeIsDeletedThoughEverybodysListNamesIt) {
+    const Dictionary now = without(tree(), "G:CXGroup");
+    const auto isHere = [](const UniqueId& uid) { return uid.str() != "G:CXGroup"; };
+    EXPECT_EQ(kindOf(tree(), now), Kind::lostAGroup);
+    EXPECT_TRUE(treeCondition(tree(), now, std::nullopt, isHere).isSound());
+    const Dictionary alone = namesAlone(tree(), now, isHere);
+    EXPECT_EQ(alone, (Dictionary{{"AllCXGroup", Array{"G:CXGroup"}}}));
+    EXPECT_TRUE(removalOfNamesAlone(tree(), alone, {}, kNow).empty()) << "somebody is deleting it";
+    Dictionary seen = tree();
+    seen.set(kNamesAlone, namesTogether({}, alone, {}, kNow));
+    const CXDChangeRecords removals = removalOfNamesAlone(seen, alone, {}, kNow);
+    ASSERT_EQ(removals.size(), 1u);
+    EXPECT_EQ(removals[0]->type(), CXDRemoveGroupFromGroup);
+    EXPECT_EQ(removals[0]->person(), UniqueId("G:CXGroup"));
+    seen.remove("G:CXGroup");
+    EXPECT_TRUE(removalOfNamesAlone(seen, alone, {}, kNow).empty()) << "it may be new";
 }
 
 TEST(TreeCondition, WhatClosesACircleInTheOwnersDatabaseIsTakenOutWhenItStandsForTwoVisits) {
@@ -196,9 +248,9 @@ TEST(TreeCondition, WhatClosesACircleInTheOwnersDatabaseIsTakenOutWhenItStandsFo
     holds("C:CXGroup", {"A:CXGroup", "D:CXGroup"});
     const Dictionary circles = closingCircles(state, inner);
     EXPECT_EQ(circles, (Dictionary{{"C:CXGroup", Array{"A:CXGroup"}}}));
-    EXPECT_TRUE(removalOfNamesAlone(state, {}, circles).empty()) << "somebody is turning them round";
-    state.set(kNamesAlone, namesTogether({}, circles));
-    const CXDChangeRecords removals = removalOfNamesAlone(state, {}, circles);
+    EXPECT_TRUE(removalOfNamesAlone(state, {}, circles, kNow).empty()) << "somebody is turning them round";
+    state.set(kNamesAlone, namesTogether({}, {}, circles, kNow));
+    const CXDChangeRecords removals = removalOfNamesAlone(state, {}, circles, kNow);
     ASSERT_EQ(removals.size(), 1u);
     EXPECT_EQ(removals[0]->person(), UniqueId("A:CXGroup"));
     EXPECT_EQ(removals[0]->group(), UniqueId("C:CXGroup"));

@@ -77,8 +77,9 @@ TEST_F(CommonVersion, KnowsWhatWasSentUntilOneIsSet) {
     const auto version = d.open("another")->commonVersion(ada);
     ASSERT_TRUE(version);
     ASSERT_EQ(version->sent.size(), 2u) << "each once";
-    EXPECT_EQ(*version->sent[0], *one);
-    EXPECT_EQ(*version->sent[1], *two);
+    EXPECT_EQ(*version->sent[0].properties, *one);
+    EXPECT_EQ(*version->sent[1].properties, *two);
+    EXPECT_EQ(version->sent[1].edited, version->edited);
     d->setCommonVersion(ada, one);
     d->save();
     EXPECT_TRUE(d->commonVersion(ada)->properties) << "of the second edit";

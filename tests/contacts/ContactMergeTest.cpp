@@ -304,6 +304,35 @@ TEST(ContactMerge, OfAVersionThatCameTheOthersChangesAreTold) {
     EXPECT_TRUE(result.conflicts.empty());
 }
 
+TEST(ContactMerge, AnEntryThatCameTellsThatAllOfItsVersionCame) {
+    Facts base, sent, ours, theirs;
+    base.phone = {{"a", {"home", "1"}}};
+    sent.phone = {{"a", {"home", "11"}}, {"b", {"home", "2"}}};
+    ours.phone = sent.phone;
+    theirs.phone = {{"b", {"home", "2"}}}; // they have seen 11, and removed it
+    const Dictionary common = cxBaseAfterSending(base.contact(), sent.contact(), theirs.contact());
+    EXPECT_EQ(content(common), content(sent.contact()));
+    const auto result = mergedContact(common, ours.contact(), theirs.contact(), CXSide::ours);
+    EXPECT_EQ(content(result.contact), content(theirs.contact()));
+}
+
+TEST(ContactMerge, OfASingleValueThatMayHaveComeTheOthersStandsAndItIsAConflict) {
+    const Dictionary base{{kCXFirstNameProperty, "0"}}, sent{{kCXFirstNameProperty, "1"}},
+        theirs{{kCXFirstNameProperty, "2"}};
+    const Dictionary common = cxBaseAfterSending(base, sent, theirs);
+    CXMergeResult result = mergedContact(common, sent, theirs, CXSide::ours);
+    cxYieldWhatWasSent(result, sent);
+    EXPECT_EQ(result.contact, theirs);
+    ASSERT_EQ(result.conflicts.size(), 1u);
+    EXPECT_EQ(result.conflicts[0], (CXMergeConflict{kCXFirstNameProperty, theirs, sent, CXSide::theirs}));
+    // Edited once more since, it is later than anything that they have seen.
+    const Dictionary ours{{kCXFirstNameProperty, "3"}};
+    CXMergeResult later = mergedContact(common, ours, theirs, CXSide::ours);
+    cxYieldWhatWasSent(later, sent);
+    EXPECT_EQ(later.contact, ours);
+    EXPECT_EQ(later.conflicts[0].winner, CXSide::ours);
+}
+
 // Without a base the result holds what the merging of two cards holds.
 RC_GTEST_PROP(ContactMerge, WithoutABaseNoValueIsLost, ()) {
     const Dictionary ours = (*anyFacts()).contact(), theirs = (*anyFacts()).contact();

@@ -193,7 +193,7 @@ public:
     LocalNotifications distributed;
     Preferences preferences{directory / "preferences.db", daemonMemory(directory / "contacts.db")};
     RunLoop loop;
-    ClockAhead clock; // the engine's
+    ClockAhead clock; // the engine's and the store's conduit's
     NoProgress progress;
     ThrowingEnd processEnd;
     FakeAccount account;
@@ -207,8 +207,7 @@ public:
 
 private:
     EngineConduits conduits(ConduitEngine& owner) {
-        CXDVaultraConduit::World parts{manager, network,     preferences, Clock::system(),
-                                       center,  distributed, alert,       *database};
+        CXDVaultraConduit::World parts{manager, network, preferences, clock, center, distributed, alert, *database};
         parts.withdrawals = &notice;
         auto vaultra = std::make_unique<CXDVaultraConduit>(owner, std::move(parts));
         auto cx = std::make_unique<CXDCXConduit>(

@@ -14,6 +14,26 @@ namespace {
 
 constexpr const char* kWrites = "'PUT', 'DELETE', 'MKCOL', 'MOVE', 'COPY', 'PROPPATCH', 'ACL'";
 
+// Between two looks somebody may have listed the contact that one of them found in no list.
+TEST(RefusedChanges, WhatTheNextLookFindsAgainIsLeftToNoScan) {
+    auto removal = std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, CXDDeleteRecord, kSelf, UniqueId("a:CXPerson"),
+                                                     std::nullopt);
+    removal->setAppliesToSources(CXDSyncSourceVaultra);
+    const Date now{1'800'000'000};
+    for (const bool isFoundAgain : {true, false}) {
+        const auto findsAgain = [&](const CXDChangeRecord&) { return isFoundAgain; };
+        Dictionary data;
+        noteRefusedChanges(data, {removal}, {removal}, findsAgain, now);
+        ASSERT_TRUE(hasRefusedChanges(data));
+        EXPECT_EQ(data[kConduitCX].dictionary()[kUnsettledPeople].dictionary().empty(), isFoundAgain);
+        data[kConduitCX].dictionary().remove(kUnsettledPeople);
+        CXDChangeRecords gathered{removal};
+        holdBackRefusedChanges(data, gathered, findsAgain, now.addingSeconds(1));
+        EXPECT_TRUE(gathered.empty());
+        EXPECT_EQ(data[kConduitCX].dictionary()[kUnsettledPeople].dictionary().empty(), isFoundAgain);
+    }
+}
+
 // An httpd that refuses writes in Alice's tree (403) while there is a file that says so.
 class RefusingStore {
 public:

@@ -193,6 +193,42 @@ TEST_F(TakenBackPass, ANameThatSomebodyElseGivesInThePlaceOfItsOwnStays) {
     EXPECT_EQ(friends->name(), "Bob's") << log.text();
 }
 
+TEST_F(TakenBackPass, ANewGroupKeepsTheNameThatItIsGivenBehindIt) {
+    const CXGroupRef crew = alice.group("Crew", {people[1]});
+    passThatIsTakenBack(alice);
+    rename(alice, crew, "Band");
+    settle();
+    EXPECT_EQ(crew->name(), "Band") << log.text();
+}
+
+// Bob's version came, and Alice has seen it, though Bob's daemon does not know that.
+TEST_F(TakenBackPass, AValueThatTheOtherOneReplacedIsNotBroughtBackByALaterEdit) {
+    bob.pass();
+    const CXPersonRef copy = bob.copyOf(people[1]);
+    CXMutableMultiValue numbers;
+    numbers.addValue("1", kCXHomeLabel);
+    numbers.addValue("2", kCXWorkLabel);
+    copy->setValue(Value("Bob's"), kCXNicknameProperty);
+    copy->setValue(numbers, kCXPhoneProperty);
+    bob.application->save();
+    passThatIsTakenBack(bob);
+    alice.pass();
+    ASSERT_EQ(people[1]->valueForProperty(kCXNicknameProperty), Value("Bob's")) << log.text();
+    people[1]->setValue(Value("Alice's"), kCXNicknameProperty);
+    CXMutableMultiValue one;
+    const auto both = people[1]->multiValueForProperty(kCXPhoneProperty);
+    one.addValue("2", kCXWorkLabel, both->entries()[1].identifier);
+    people[1]->setValue(one, kCXPhoneProperty);
+    alice.application->save();
+    alice.pass();
+    copy->setValue(Value("Later"), kCXNoteProperty);
+    bob.application->save();
+    settle();
+    EXPECT_EQ(people[1]->valueForProperty(kCXNicknameProperty), Value("Alice's")) << log.text();
+    EXPECT_EQ(people[1]->multiValueForProperty(kCXPhoneProperty)->entries().size(), 1u) << log.text();
+    EXPECT_EQ(people[1]->valueForProperty(kCXNoteProperty), Value("Later")) << log.text();
+}
+
 TEST_F(TakenBackPass, ANewGroupKeepsTheNameThatItIsGivenDuringTheNextPass) {
     const CXGroupRef crew = alice.group("Crew", {people[1]});
     passThatIsTakenBack(alice);

@@ -56,8 +56,7 @@ Daemon::Daemon(const Person& person, const Weather& weather, Report& report)
 }
 
 EngineConduits Daemon::conduits(ConduitEngine& owner) {
-    CXDVaultraConduit::World parts{_manager, _network,     _preferences, Clock::system(),
-                                   _center,  _distributed, _alert,       *_database};
+    CXDVaultraConduit::World parts{_manager, _network, _preferences, _clock, _center, _distributed, _alert, *_database};
     parts.withdrawals = &_notice;
     auto vaultra = std::make_unique<CXDVaultraConduit>(owner, std::move(parts));
     auto cx =

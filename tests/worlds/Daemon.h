@@ -81,7 +81,7 @@ private:
     };
 
     Report& _report;
-    const LaterClock _clock;
+    LaterClock _clock;
     std::shared_ptr<FaultyTransport> _wire;
     CXDAVManager _manager;
     NotificationCenter _center;

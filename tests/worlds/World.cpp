@@ -308,9 +308,10 @@ void World::step(size_t number) {
 
 void World::clean(char role) {
     inProcess("clean daemon", role, [&](Report& report) {
-        constexpr double kAnHour = 3600; // what a store has refused rests for half an hour at most
+        // What a store has refused rests for half an hour at most; half a new contact is left for a week.
+        constexpr double kAnHour = 3600, kAWeek = 7 * 86400;
         Weather calm;
-        if (_settling) calm.later = kAnHour;
+        if (_settling) calm.later = kAnHour + static_cast<double>(_outcome.cleanPasses) * kAWeek;
         calm.ownTree = "/dav/" + person(role).account.user.str() + "/";
         Daemon daemon(person(role), calm, report);
         daemon.pass();

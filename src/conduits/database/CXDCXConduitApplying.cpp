@@ -191,13 +191,12 @@ void CXDCXConduit::takeIn(const CXDChangeRecord& record, CXPerson& person, const
     person.resetWithDictionary(content, true, false); // what is not known goes
     const auto theirs = person.encodedRepresentation();
     const Dictionary there = BinaryValue::decode(*theirs).dictionary(), here = cxAsSent(ours);
-    const std::optional<Dictionary> base = cxCommonBase(common, here, there);
-    CXMergeResult merge = mergedContact(base, here, there, CXSide::ours);
+    CXMergeResult merge = cxMergedWithStore(common, here, there, CXSide::ours, std::nullopt);
     if (!merge.conflicts.empty()) {
         CXDConduit* source = engine().conduitForSyncSource(record.initialSource());
         const auto edited = common ? common->edited : std::optional(rolvane().personRow(person.uniqueId())->modified);
         const auto written = source ? source->dateOfContact(record) : std::nullopt;
-        merge = mergedContact(base, here, there, laterSide(edited, written, here, there));
+        merge = cxMergedWithStore(common, here, there, laterSide(edited, written, here, there), written);
     }
     if (const Value& place = there[kCXRemoteLocationProperty]) merge.contact.set(kCXRemoteLocationProperty, place);
     rolvane().noteConflicts(person.uniqueId(), merge.conflicts);

@@ -2,7 +2,6 @@
 
 #include "conduits/store/CXDVaultraConduit.h"
 #include "contacts/records/Constants.h"
-#include "contacts/records/ContactMerge.h"
 #include "contacts/records/Identifier.h"
 #include "foundation/Log.h"
 #include "foundation/PropertyList.h"
@@ -18,6 +17,7 @@ constexpr int kOk = 200;
 constexpr int kForbidden = 403;
 constexpr int kChangedMeanwhile = 412;
 constexpr int kAttempts = 4;
+constexpr double kResolution = 1; // seconds, of a store's dates
 
 Dictionary withoutLocation(const Dictionary& contact) {
     Dictionary rest = contact.mutableCopy();
@@ -29,20 +29,32 @@ std::shared_ptr<const Bytes> encoded(const Dictionary& contact) {
     return std::make_shared<const Bytes>(BinaryValue::encode(contact));
 }
 
+// A refusal of a question is none of the edit.
+void refuseNothing(int& code) {
+    if (code == kForbidden) code = 0;
+}
+
 } // namespace
 
 Dictionary cxAsSent(const Dictionary& contact) {
     return PropertyList::fromXML(PropertyList::toXML(contact)).dictionary();
 }
 
-std::optional<Dictionary> cxCommonBase(const std::optional<CXCommonVersion>& common, const Dictionary& here,
-                                       const Dictionary& there) {
-    if (!common) return std::nullopt;
-    if (!common->properties) return here; // not edited since
+CXMergeResult cxMergedWithStore(const std::optional<CXCommonVersion>& common, const Dictionary& here,
+                                const Dictionary& there, CXSide later, const std::optional<Date>& written) {
+    if (!common) return mergedContact(std::nullopt, here, there, later);
+    if (!common->properties) return mergedContact(here, here, there, later); // not edited since
     const auto decoded = [](const Bytes& content) { return cxAsSent(BinaryValue::decode(content).dictionary()); };
     Dictionary base = decoded(*common->properties);
-    for (const auto& sent : common->sent) base = cxBaseAfterSending(base, decoded(*sent), there);
-    return base;
+    std::vector<Dictionary> older; // what came, if it did, before that
+    for (const auto& [properties, edited] : common->sent) {
+        const Dictionary sent = decoded(*properties);
+        base = cxBaseAfterSending(base, sent, there);
+        if (edited && written && edited->secondsSince(*written) < kResolution) older.push_back(sent);
+    }
+    CXMergeResult merge = mergedContact(base, here, there, later);
+    for (const Dictionary& sent : older) cxYieldWhatWasSent(merge, sent);
+    return merge;
 }
 
 bool ContactWrites::put(const Place& place, const Dictionary& content, int& code) {
@@ -77,7 +89,10 @@ bool ContactWrites::write(const Place& place, const Dictionary& ours, int& code)
 bool ContactWrites::writeOver(const Place& place, const Dictionary& ours, int& code) {
     for (int attempt = 0; attempt < kAttempts; ++attempt) {
         const auto there = _manager.readVersion(place.location, CXDVaultraConduit::kSecureRecordWrites, &code);
-        if (there.failed) return false;
+        if (there.failed) {
+            refuseNothing(code);
+            return false;
+        }
         if (!there.contact) {
             if (writeWhereNoneIs(place, ours, code)) return true;
         } else if (there.isKnown) {
@@ -98,7 +113,7 @@ bool ContactWrites::writeWhereNoneIs(const Place& place, const Dictionary& ours,
         const auto list = _manager.dictionaryAtURL(place.list, CXDVaultraConduit::kSecureRecordWrites, &code);
         const Value members = list ? (*list)[kMemberUIDState] : Value();
         if (!members.isArray()) {
-            if (code == kForbidden) code = 0; // a refusal of the question is none of the edit
+            refuseNothing(code);
             return false;
         }
         if (!members.array().containsString(cxNormalizedUID(place.uniqueId).str())) {
@@ -114,9 +129,8 @@ bool ContactWrites::writeMerged(const Place& place, const Dictionary& ours, cons
                                 const std::optional<Date>& theirDate, int& code) {
     const auto common = _rolvane.commonVersion(place.uniqueId);
     const Dictionary here = withoutLocation(cxAsSent(ours)), there = withoutLocation(theirs);
-    const std::optional<Dictionary> base = cxCommonBase(common, here, there);
     const CXSide later = laterSide(common ? common->edited : std::nullopt, theirDate, here, there);
-    CXMergeResult merge = mergedContact(base, here, there, later);
+    const CXMergeResult merge = cxMergedWithStore(common, here, there, later, theirDate);
     CXDLog("%@ has been changed by somebody else, too: merged", place.location);
     _rolvane.noteConflictsAtOnce(place.uniqueId, merge.conflicts);
     bool done = merge.contact == there;

@@ -1,6 +1,7 @@
 #pragma once
 
 #include "contacts/database/CXRolvane.h"
+#include "contacts/records/ContactMerge.h"
 #include "foundation/Url.h"
 #include "foundation/Value.h"
 #include "model/CXDChangeRecord.h"
@@ -17,10 +18,11 @@ class CXDAVManager;
 
 // The contact as it comes back from a store: dates to the second, for instance.
 Dictionary cxAsSent(const Dictionary& contact);
-// The last version that the database and a store have had in common, for merging `here`, as it is sent, with
-// `there`. None where nothing is known of it.
-std::optional<Dictionary> cxCommonBase(const std::optional<CXCommonVersion>& common, const Dictionary& here,
-                                       const Dictionary& there);
+// Merges `here`, as it is sent, with `there` against the last version that the database and the store have had in
+// common, and against what has been on its way since. `common`: none where nothing is known of it. `written`: when
+// `there` was put there, to the second, as the store has it.
+CXMergeResult cxMergedWithStore(const std::optional<CXCommonVersion>& common, const Dictionary& here,
+                                const Dictionary& there, CXSide later, const std::optional<Date>& written);
 
 // Writes edited contacts into trees that others write to, too. A version that the client does not know is merged with
 // the own one (contacts/records/ContactMerge.h) before it is written over, and only the version that was read is

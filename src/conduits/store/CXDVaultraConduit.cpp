@@ -32,6 +32,11 @@ CXDVaultraConduit::~CXDVaultraConduit() {
     if (_serverDate.valid()) _serverDate.wait();
 }
 
+void CXDVaultraConduit::willGather() {
+    _gathering = true;
+    _foundAgain.clear();
+}
+
 std::optional<std::string> CXDVaultraConduit::conduitID() const {
     return kConduitVaultra;
 }

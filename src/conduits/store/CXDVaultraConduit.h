@@ -75,7 +75,8 @@ public:
     void willWrite(const CXDChangeRecords& records) override;
     CXDChangeRecords takeMerged() override;
     std::optional<Date> dateOfContact(const CXDChangeRecord& record) override;
-    void willGather() override { _gathering = true; }
+    void willGather() override;
+    bool findsAgain(const CXDChangeRecord& record) const override;
     // A refused user name or password warns the person, at most once in 15 minutes, and ends the daemon. In a
     // gathering the structure of a tree of which nothing is known is looked after while the pass goes on; what needs it
     // waits.
@@ -140,6 +141,8 @@ private:
     bool isMended(const Dictionary& prior, const Dictionary& state);
     bool isToBePublishedAgain();
     void mendOwnTree(const Dictionary& prior, const Dictionary& state);
+    void takeUnlistedAway(Dictionary prior, const Dictionary& state);
+    void noteUnlisted(const UniqueId& name);
     void takeNamesAloneOut(Dictionary prior, const Dictionary& state);
     bool somebodyMayWrite(); // besides the owner
     bool allGroupHas(const char* property);
@@ -176,6 +179,7 @@ private:
     std::atomic<bool> _isOlderCopy = false;       // the own tree: it is older than the database
     std::set<UserName> _setBack;                  // other trees that are, as this pass has seen; main thread
     CXDChangeRecords _leftovers;                  // of the gathering that is under way
+    std::set<UniqueId> _foundAgain;               // contacts that the next look takes away, too; of this gathering
     std::map<UserName, Dictionary> _read;         // so far: the states of known users
     std::map<UserName, Comparison> _foundNothing; // the last comparisons that found nothing
     std::map<UserName, Comparison> _compared;     // those of the gathering that is under way

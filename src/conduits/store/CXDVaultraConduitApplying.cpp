@@ -179,10 +179,10 @@ bool CXDVaultraConduit::makeCompositeGroupChange(CXDChangeRecord& record, int& c
     if (!state && (code == kMissing || code == kOk)) state = lastKnownState(record);
     const Dictionary changed = layout::groupStateAfterComposite(state.value_or(Dictionary()), contentOf(record));
     // A state that is there and could not be read is not replaced by a part of it: the client then sends no write, and
-    // the answer to the read stands.
+    // the answer to the read stands. A refusal of the question is none of the change.
     int written = 0;
     const bool done = _world.manager.write(stringForDictionary(changed), location, kSecureRecordWrites, &written);
-    if (written != 0) code = written;
+    if (written != 0 || code == kForbidden) code = written;
     return done;
 }
 

@@ -15,6 +15,7 @@
 #include "model/PayloadKeys.h"
 #include "model/RemoteLocationMap.h"
 
+#include <algorithm>
 #include <map>
 #include <set>
 #include <utility>
@@ -36,7 +37,9 @@ bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state)
     if (isOwn && !isMended(prior, state)) return false;
     const Value knownSerial = prior[kSerialNumber], serial = state[kSerialNumber];
     if (!serial.isString() || (knownSerial.isString() && knownSerial != serial)) return true; // no tree, or another one
-    const TreeCondition condition = treeCondition(prior, state, isOwn ? _lastSyncDate : std::nullopt);
+    const IsHere isHere = [&](const UniqueId& name) { return _world.rolvane.recordForUniqueId(name) != nullptr; };
+    const TreeCondition condition =
+        isOwn ? treeCondition(prior, state, _lastSyncDate, isHere) : treeCondition(prior, state, std::nullopt);
     const Value looked = prior[kLookAgain];
     prior.remove(kLookAgain);
     if (condition.isSound()) {
@@ -103,7 +106,7 @@ void CXDVaultraConduit::noteWithoutChanges(int64_t journal, const std::set<UserN
 // Single files that are too many or too few: another writer has deleted what somebody else was about to write, or the
 // store has lost them.
 void CXDVaultraConduit::mendOwnTree(const Dictionary& prior, const Dictionary& state) {
-    if (_isWrittenByOthers) _leftovers = removalOfUnlisted(prior, state);
+    if (_isWrittenByOthers) takeUnlistedAway(prior, state);
     if (!allGroupHas(kCXRemoteLocationProperty)) return; // the list may be older than the withdrawal
     if (_isWrittenByOthers) takeNamesAloneOut(prior, state);
     size_t written = 0;
@@ -119,6 +122,33 @@ void CXDVaultraConduit::mendOwnTree(const Dictionary& prior, const Dictionary& s
     if (written > 0) CXLog("The store has lost the files of %@ contacts, which are written again.", written);
 }
 
+// Contacts that no list names. One that the list has named until now has been deleted by somebody, and goes at once.
+// Whoever wrote another one may still list it, so it is given its time.
+void CXDVaultraConduit::takeUnlistedAway(Dictionary prior, const Dictionary& state) {
+    _leftovers = removalOfUnlisted(prior, state);
+    const Date now = _world.clock.now();
+    Dictionary noted = prior[kUnlistedContacts].dictionary().mutableCopy();
+    for (const CXDChangeRecordPtr& removal : _leftovers)
+        if (removal->type() == CXDDeleteRecord) noted.set(removal->person()->str(), now.addingSeconds(-kPatience));
+    std::vector<UniqueId> known;
+    for (const std::string& name : noted.allKeys()) known.emplace_back(name);
+    Dictionary still;
+    for (const UniqueId& name : contactsThatAreUnlisted(state, known)) {
+        if (_world.rolvane.recordForUniqueId(cxUIDWithTableName(name, kCXPersonTable))) continue; // to be listed
+        const Date since = noted[name.str()].date().value_or(now);
+        still.set(name.str(), since);
+        if (now.secondsSince(since) < kPatience) continue;
+        _foundAgain.insert(name);
+        const bool goesAlready = std::any_of(_leftovers.begin(), _leftovers.end(),
+                                             [&](const CXDChangeRecordPtr& each) { return each->person() == name; });
+        if (!goesAlready) _leftovers.push_back(removalOfContact(name));
+    }
+    if (still.empty())
+        prior.remove(kUnlistedContacts);
+    else
+        prior.set(kUnlistedContacts, still);
+}
+
 // Groups that name a contact or a group which is nowhere, or a group that the owner's database cannot take in.
 void CXDVaultraConduit::takeNamesAloneOut(Dictionary prior, const Dictionary& state) {
     const Dictionary alone = namesAlone(
@@ -130,9 +160,11 @@ void CXDVaultraConduit::takeNamesAloneOut(Dictionary prior, const Dictionary& st
         for (UniqueId& each : inner) each = cxUIDWithTableName(each, kCXGroupTable);
         return inner;
     });
-    const CXDChangeRecords removals = removalOfNamesAlone(prior, alone, circles);
+    const Date now = _world.clock.now();
+    const CXDChangeRecords removals = removalOfNamesAlone(prior, alone, circles, now);
     _leftovers.insert(_leftovers.end(), removals.begin(), removals.end());
-    if (const Dictionary all = namesTogether(alone, circles); all.empty())
+    const Dictionary before = prior[kNamesAlone].dictionary();
+    if (const Dictionary all = namesTogether(before, alone, circles, now); all.empty())
         prior.remove(kNamesAlone);
     else
         prior.set(kNamesAlone, all);
@@ -207,7 +239,8 @@ void CXDVaultraConduit::compareUnlistedGroups(CXDChangeRecords& records) {
 
 // A contact that the list of everybody does not name and that joins no group is about to be added, and comes when it is
 // listed; or it has been deleted and was written once more by somebody who did not know. Whoever knows it reads what is
-// written. Nobody else takes it in: it would stay behind when its file goes. From the own tree it is taken away.
+// written. Nobody else takes it in: it would stay behind when its file goes. From the own tree it is taken away when
+// its time is over.
 // (Where single groups are published, the list of everybody does not name all who have joined one since.)
 void CXDVaultraConduit::leaveUnlistedOut(CXDChangeRecords& records) {
     std::map<UserName, ListedNames> lists;
@@ -226,9 +259,22 @@ void CXDVaultraConduit::leaveUnlistedOut(CXDChangeRecords& records) {
             return false;
         if (_world.rolvane.recordForUniqueId(*record->person())) return false;
         CXDLog("Not listed, and left out: %@", record);
-        if (record->user() == kSelf && _isWrittenByOthers) _leftovers.push_back(removalOfContact(shared));
+        if (record->user() == kSelf && _isWrittenByOthers) noteUnlisted(shared);
         return true;
     });
+}
+
+void CXDVaultraConduit::noteUnlisted(const UniqueId& name) {
+    const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
+    const Dictionary* prior = users[kSelf.str()].dictionaryIf();
+    if (!prior) return;
+    Dictionary noted = Dictionary(*prior).dictionaryFor(kUnlistedContacts);
+    if (!noted.contains(name.str())) noted.set(name.str(), _world.clock.now());
+}
+
+bool CXDVaultraConduit::findsAgain(const CXDChangeRecord& record) const {
+    return record.type() == CXDDeleteRecord && record.user() == kSelf && record.person() &&
+           _foundAgain.contains(*record.person());
 }
 
 // The next scan takes everything for new.

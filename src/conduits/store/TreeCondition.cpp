@@ -25,6 +25,10 @@ bool isGroup(std::string_view name) {
     return name.ends_with("CXGroup");
 }
 
+bool isNamed(const Value& remembered, const std::string& name) {
+    return remembered.isArray() ? remembered.array().containsString(name) : remembered.dictionary().contains(name);
+}
+
 Array groupsOfEverybody(const Dictionary& state) {
     return state[kEverybody].dictionary()[kSubgroupUIDState].array();
 }
@@ -42,11 +46,11 @@ std::unordered_set<std::string> groupsThatAreListed(const Dictionary& prior, con
     return listed;
 }
 
-bool hasLostAGroup(const Dictionary& prior, const Dictionary& current) {
+bool hasLostAGroup(const Dictionary& prior, const Dictionary& current, const IsHere& isHere) {
     std::vector<std::string> missing;
     for (const auto& [name, group] : prior)
         if (isGroup(name) && name != kEverybody && !group.dictionary().empty() && current[name].dictionary().empty())
-            missing.push_back(name);
+            if (!isHere || isHere(UniqueId(name))) missing.push_back(name);
     if (missing.empty()) return false;
     const auto listed = groupsThatAreListed(prior, current);
     return std::any_of(missing.begin(), missing.end(), [&](const auto& name) { return listed.contains(name); });
@@ -95,7 +99,8 @@ CXDChangeRecordPtr ownersChange(CXDChangeType type, std::optional<UniqueId> pers
 
 } // namespace
 
-TreeCondition treeCondition(const Dictionary& prior, const Dictionary& current, std::optional<Date> lastVisit) {
+TreeCondition treeCondition(const Dictionary& prior, const Dictionary& current, std::optional<Date> lastVisit,
+                            const IsHere& isHere) {
     if (isSetBack(prior, current, lastVisit)) return {Kind::setBack, "is a copy from another time"};
     if (prior[kEverybody].dictionary()[kMemberUIDState].array().empty()) return {};
     const Dictionary people = current[kPeopleState].dictionary()[kMemberUIDState].dictionary();
@@ -106,7 +111,7 @@ TreeCondition treeCondition(const Dictionary& prior, const Dictionary& current, 
         return {Kind::lostLists, "has lost the list of its contacts"};
     if (listed && isListReplaced(prior[kEverybody].dictionary()[kMemberUIDState].array(), *listed, people))
         return {Kind::replacedList, "has another list, which names nobody of those who lie there"};
-    if (hasLostAGroup(prior, current)) return {Kind::lostAGroup, "has lost a group that it still names"};
+    if (hasLostAGroup(prior, current, isHere)) return {Kind::lostAGroup, "has lost a group that it still names"};
     const bool isEmptied = listed && listed->empty();
     // A writer takes a contact's file away before the name. Its owner writes what is missing, file by file.
     if (!hasContacts && !isEmptied && !lastVisit) return {Kind::lostContacts, "has lost the contents of its contacts"};
@@ -159,15 +164,14 @@ CXDChangeRecords removalOfUnlisted(const Dictionary& prior, const Dictionary& cu
 }
 
 std::vector<UniqueId> unlistedGroupsThatAreGone(const Dictionary& prior, const Dictionary& current,
-                                                const std::function<bool(const UniqueId& name)>& isHere) {
+                                                const IsHere& isHere) {
     std::vector<UniqueId> gone;
     for (UniqueId& group : unlistedGroups(prior, current))
         if (current[group.str()].dictionary().empty() && isHere(group)) gone.push_back(std::move(group));
     return gone;
 }
 
-CXDChangeRecords removalOfUnlistedGroups(const Dictionary& prior, const Dictionary& current,
-                                         const std::function<bool(const UniqueId& name)>& isHere) {
+CXDChangeRecords removalOfUnlistedGroups(const Dictionary& prior, const Dictionary& current, const IsHere& isHere) {
     CXDChangeRecords removals;
     for (const UniqueId& group : unlistedGroups(prior, current))
         if (!current[group.str()].dictionary().empty() && !isHere(group))
@@ -175,8 +179,7 @@ CXDChangeRecords removalOfUnlistedGroups(const Dictionary& prior, const Dictiona
     return removals;
 }
 
-Dictionary namesAlone(const Dictionary& prior, const Dictionary& current,
-                      const std::function<bool(const UniqueId& name)>& isHere) {
+Dictionary namesAlone(const Dictionary& prior, const Dictionary& current, const IsHere& isHere) {
     Dictionary alone;
     if (!current[kEverybody].dictionary().contains(kMemberUIDState)) return alone;
     const ListedNames people(current, kMemberUIDState), peopleBefore(prior, kMemberUIDState);
@@ -203,6 +206,9 @@ Dictionary namesAlone(const Dictionary& prior, const Dictionary& current,
     Array nowhere;
     for (const UniqueId& uid : contactsThatAreMissing(current))
         if (!isHere(uid)) nowhere.append(uid);
+    for (const Value& name : groupsOfEverybody(current))
+        if (const UniqueId uid(name.string()); current[uid.str()].dictionary().empty() && !isHere(uid))
+            nowhere.append(name);
     if (!nowhere.empty()) alone.set(kEverybody, nowhere);
     return alone;
 }
@@ -232,7 +238,8 @@ Dictionary closingCircles(const Dictionary& current,
     return closing;
 }
 
-CXDChangeRecords removalOfNamesAlone(const Dictionary& prior, const Dictionary& alone, const Dictionary& circles) {
+CXDChangeRecords removalOfNamesAlone(const Dictionary& prior, const Dictionary& alone, const Dictionary& circles,
+                                     Date now) {
     CXDChangeRecords removals;
     if (alone.empty() && circles.empty()) return removals;
     const ListedNames peopleBefore(prior, kMemberUIDState), groupsBefore(prior, kSubgroupUIDState);
@@ -245,21 +252,48 @@ CXDChangeRecords removalOfNamesAlone(const Dictionary& prior, const Dictionary& 
         for (const Value& name : names.array()) {
             const UniqueId uid(name.string());
             const bool wasListed = group != kEverybody && (peopleBefore.contains(uid) || groupsBefore.contains(uid));
-            if (wasListed || before[group].array().containsString(name.string())) remove(group, name);
+            const auto since = before[group].dictionary()[name.string()].date();
+            // A group that was there once is not still to come.
+            const bool hasTime = group != kEverybody || !prior.contains(uid.str());
+            const double patience = hasTime ? kPatience : 0;
+            if (wasListed || (since && now.secondsSince(*since) >= patience)) remove(group, name);
         }
     for (const auto& [group, names] : circles)
         for (const Value& name : names.array())
-            if (before[group].array().containsString(name.string())) remove(group, name);
+            if (isNamed(before[group], name.string())) remove(group, name);
     return removals;
 }
 
-Dictionary namesTogether(const Dictionary& alone, const Dictionary& circles) {
-    Dictionary all = Value(alone).deepMutableCopy().dictionary();
-    for (const auto& [group, names] : circles) {
-        Array together = all.arrayFor(group);
-        for (const Value& name : names.array()) together.append(name);
-    }
+Dictionary namesTogether(const Dictionary& before, const Dictionary& alone, const Dictionary& circles, Date now) {
+    Dictionary all;
+    for (const Dictionary& each : {alone, circles})
+        for (const auto& [group, names] : each) {
+            const Dictionary known = before[group].dictionary();
+            Dictionary dates = all.dictionaryFor(group);
+            for (const Value& name : names.array()) dates.set(name.string(), known[name.string()].date().value_or(now));
+        }
     return all;
+}
+
+std::vector<UniqueId> contactsThatAreUnlisted(const Dictionary& current, const std::vector<UniqueId>& candidates) {
+    std::vector<UniqueId> unlisted;
+    const Array* everybody = current[kEverybody].dictionary()[kMemberUIDState].arrayIf();
+    const Dictionary files = current[kPeopleState].dictionary()[kMemberUIDState].dictionary();
+    if (!everybody || (files.count() == everybody->count() && candidates.empty())) return unlisted;
+    std::unordered_set<std::string> named;
+    for (const auto& [name, state] : current)
+        if (isGroup(name))
+            for (const Value& member : state.dictionary()[kMemberUIDState].array()) named.insert(member.string());
+    const auto consider = [&](const std::string& name) {
+        if (!named.contains(name)) unlisted.emplace_back(name);
+    };
+    if (files.count() != everybody->count()) {
+        for (const auto& [name, info] : files) consider(name);
+        return unlisted;
+    }
+    for (const UniqueId& name : candidates)
+        if (files.contains(name.str())) consider(name.str());
+    return unlisted;
 }
 
 CXDChangeRecordPtr removalOfContact(const UniqueId& person) {

@@ -23,7 +23,15 @@
 namespace rolvane {
 
 inline constexpr const char* kTreeDates = "TreeDates";
-inline constexpr const char* kNamesAlone = "NamesAlone"; // as namesTogether gives them
+inline constexpr const char* kNamesAlone = "NamesAlone";             // as namesTogether gives them
+inline constexpr const char* kUnlistedContacts = "UnlistedContacts"; // name -> date since when it has been seen so
+
+// Somebody who may write puts a new contact's file and its name on the store one after the other, in either order, and
+// may be cut off in between for as long as a machine is switched off. One without the other is left so long.
+inline constexpr double kPatience = 7 * 86400; // seconds
+
+// Whether the owner's database, or the copy, has a person or group.
+using IsHere = std::function<bool(const UniqueId& name)>;
 
 struct TreeCondition {
     enum class Kind {
@@ -45,7 +53,9 @@ struct TreeCondition {
 // `prior` is the state that the last pass left, `current` what the store says now, both of one tree (one serial
 // number). `lastVisit`: of the owner, the date that "dateFile" had when the owner's last pass ended.
 // The owner knows of a list that is nowhere; to a subscriber the contacts that lie there are one.
-TreeCondition treeCondition(const Dictionary& prior, const Dictionary& current, std::optional<Date> lastVisit);
+// `isHere`, of the owner: a group that has left the database, too, is deleted and not lost.
+TreeCondition treeCondition(const Dictionary& prior, const Dictionary& current, std::optional<Date> lastVisit,
+                            const IsHere& isHere = {});
 
 // Nobody but the owner can mend a tree that was set back. What to remember as its dates, so that it counts as set back
 // until its owner has been there again.
@@ -61,19 +71,17 @@ CXDChangeRecords removalOfUnlisted(const Dictionary& prior, const Dictionary& cu
 // Groups that are known, were named by no list of everybody yet, and whose state is gone: somebody else has deleted
 // them, and no list tells it. Of those that `isHere` knows, which tells of the database.
 std::vector<UniqueId> unlistedGroupsThatAreGone(const Dictionary& prior, const Dictionary& current,
-                                                const std::function<bool(const UniqueId& name)>& isHere);
+                                                const IsHere& isHere);
 
 // The owner's changes that take away known groups which lie there, are named by no list of everybody, and have left the
 // database: no comparison of lists tells of them. `isHere` as above.
-CXDChangeRecords removalOfUnlistedGroups(const Dictionary& prior, const Dictionary& current,
-                                         const std::function<bool(const UniqueId& name)>& isHere);
+CXDChangeRecords removalOfUnlistedGroups(const Dictionary& prior, const Dictionary& current, const IsHere& isHere);
 
 // The contacts and groups that groups name though neither the list of everybody nor a file does: group -> array of
 // names. Somebody has put them there while somebody else deleted them; or a new one's file is still to come. `isHere`:
-// the owner's database has it; one that the list has lost since `prior` is about to leave it. And the contacts that the
-// list of everybody itself names, and that are neither there nor here: they were deleted before it named them.
-Dictionary namesAlone(const Dictionary& prior, const Dictionary& current,
-                      const std::function<bool(const UniqueId& name)>& isHere);
+// the owner's database has it; one that the list has lost since `prior` is about to leave it. And the contacts and
+// groups that the list of everybody itself names, and that are neither there nor here: they were deleted.
+Dictionary namesAlone(const Dictionary& prior, const Dictionary& current, const IsHere& isHere);
 
 // Groups within groups that the owner's database cannot take in: there, the inner one holds the outer one already, over
 // others perhaps. Two people have nested them at the same time; or somebody is turning them round at this moment.
@@ -81,12 +89,19 @@ Dictionary namesAlone(const Dictionary& prior, const Dictionary& current,
 Dictionary closingCircles(const Dictionary& current,
                           const std::function<std::vector<UniqueId>(const UniqueId& group)>& subgroupsHere);
 
-// The changes of the owner's that take such names out of their groups: those alone that the list of everybody has lost
-// since `prior`, and all that stood so at the last visit already ("NamesAlone" of `prior`).
-CXDChangeRecords removalOfNamesAlone(const Dictionary& prior, const Dictionary& alone, const Dictionary& circles = {});
+// The changes of the owner's that take such names out of their groups. At once: names that the list of everybody has
+// lost since `prior`. At the second visit: those that close a circle, and groups that the list of everybody names and
+// `prior` knows. After kPatience: all others. "NamesAlone" of `prior` tells since when each stands so.
+CXDChangeRecords removalOfNamesAlone(const Dictionary& prior, const Dictionary& alone, const Dictionary& circles,
+                                     Date now);
 
-// Both together, as they are remembered.
-Dictionary namesTogether(const Dictionary& alone, const Dictionary& circles);
+// Both together, as they are remembered: group -> {name -> date since when it stands so}. `before` is what the last
+// visit remembered; an earlier version remembered arrays of names, whose time begins now.
+Dictionary namesTogether(const Dictionary& before, const Dictionary& alone, const Dictionary& circles, Date now);
+
+// Contacts that lie there and that no group names. Looks at all of them where their number and that of the list of
+// everybody differ; else at `candidates` alone. None while that list is not there.
+std::vector<UniqueId> contactsThatAreUnlisted(const Dictionary& current, const std::vector<UniqueId>& candidates);
 
 // The change that takes one contact off the store.
 CXDChangeRecordPtr removalOfContact(const UniqueId& person);

@@ -10,15 +10,21 @@ std::optional<CXCommonVersion> CommonVersions::of(const UniqueId& uid) {
     if (!s.isNull(0)) version.properties = std::make_shared<const Bytes>(s.bytes(0));
     if (!s.isNull(1)) version.edited = Date(s.real(1));
     if (!version.properties || !hasSentTable()) return version;
-    auto sent = _database.statement(
-        "SELECT properties FROM sent WHERE record_id=(SELECT id FROM records WHERE uid=?) ORDER BY rowid");
+    auto sent = _database.statement(std::string("SELECT properties, ") + (datesSent() ? "edited" : "NULL") +
+                                    " FROM sent WHERE record_id=(SELECT id FROM records WHERE uid=?) ORDER BY rowid");
     sent.bind(1, uid.str());
-    while (sent.step()) version.sent.push_back(std::make_shared<const Bytes>(sent.bytes(0)));
+    while (sent.step())
+        version.sent.push_back({std::make_shared<const Bytes>(sent.bytes(0)),
+                                sent.isNull(1) ? std::nullopt : std::optional(Date(sent.real(1)))});
     return version;
 }
 
 bool CommonVersions::hasSentTable() {
     return _database.statement("SELECT 1 FROM sqlite_master WHERE type='table' AND name='sent'").step();
+}
+
+bool CommonVersions::datesSent() {
+    return _database.statement("SELECT 1 FROM pragma_table_info('sent') WHERE name='edited'").step();
 }
 
 std::vector<UniqueId> CommonVersions::edited() {
@@ -48,8 +54,13 @@ void CommonVersions::set(const UniqueId& uid, const Bytes& properties) {
 }
 
 void CommonVersions::addSent(const UniqueId& uid, const Bytes& properties) {
-    if (!hasSentTable()) _database.execute(kSentTable);
-    _database.statement("INSERT OR IGNORE INTO sent SELECT id, ?2 FROM records WHERE uid=?1")
+    if (!hasSentTable())
+        _database.execute(kSentTable);
+    else if (!datesSent())
+        _database.execute("ALTER TABLE sent ADD COLUMN edited REAL");
+    _database
+        .statement("INSERT OR IGNORE INTO sent(record_id, properties, edited) "
+                   "SELECT r.id, ?2, c.edited FROM records r LEFT JOIN common c ON c.record_id=r.id WHERE r.uid=?1")
         .bind(1, uid.str())
         .bind(2, properties)
         .run();

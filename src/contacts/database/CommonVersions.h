@@ -15,8 +15,12 @@ struct CXCommonVersion {
     std::shared_ptr<const Bytes> properties; // encoded; null: the contact was not edited since
     std::optional<Date> edited;              // the last edit; missing when there was none
     // Contents of the edited contact, encoded, that were on their way to a store: each may have come there, and nobody
-    // knows. Empty when the contact was not edited.
-    std::vector<std::shared_ptr<const Bytes>> sent = {};
+    // knows. With the last edit in them, which an earlier version did not note. Empty when the contact was not edited.
+    struct Sent {
+        std::shared_ptr<const Bytes> properties;
+        std::optional<Date> edited;
+    };
+    std::vector<Sent> sent = {};
 };
 
 // The table of them: a row for each contact that a store is known to have had. A second table has what was on its way;
@@ -50,9 +54,11 @@ private:
 CREATE TABLE IF NOT EXISTS sent(
   record_id INTEGER NOT NULL REFERENCES records(id) ON DELETE CASCADE,
   properties BLOB NOT NULL,
+  edited REAL,
   UNIQUE(record_id, properties));
 )";
     bool hasSentTable();
+    bool datesSent(); // the table was made by a version that notes the last edit
 
     Sqlite& _database;
 };

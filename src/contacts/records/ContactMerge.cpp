@@ -194,6 +194,24 @@ Value sentList(const Value& base, const Value& sent, const Value& theirs) {
     return result;
 }
 
+// An entry that was new in what was sent lies there: a version is written whole, so all of it has come.
+bool hasCome(const Dictionary& base, const Dictionary& sent, const Dictionary& theirs) {
+    return std::any_of(sent.begin(), sent.end(), [&](const auto& property) {
+        const auto& [name, value] = property;
+        if (!CXMultiValue::isMultiValue(value) || !CXMultiValue::isMultiValue(theirs[name])) return false;
+        const Entries before = entriesOf(base[name]), there = entriesOf(theirs[name]);
+        const auto isIn = [](const Entries& entries, const auto& is) {
+            return std::any_of(entries.begin(), entries.end(), is);
+        };
+        for (const auto& entry : entriesOf(value)) {
+            const auto hasItsIdentifier = [&](const auto& each) { return each.identifier == entry.identifier; };
+            const auto isTheSame = [&](const auto& each) { return hasItsIdentifier(each) && says(each, entry); };
+            if (!isIn(before, hasItsIdentifier) && isIn(there, isTheSame)) return true;
+        }
+        return false;
+    });
+}
+
 class ContactMerging {
 public:
     ContactMerging(const Dictionary& base, const Dictionary& ours, const Dictionary& theirs, CXSide later)
@@ -266,6 +284,7 @@ CXMergeResult mergedContact(const std::optional<Dictionary>& base, const Diction
 }
 
 Dictionary cxBaseAfterSending(const Dictionary& base, const Dictionary& sent, const Dictionary& theirs) {
+    if (hasCome(base, sent, theirs)) return sent;
     Dictionary result = base.mutableCopy();
     std::set<std::string> names;
     for (const Dictionary& side : {base, sent, theirs})
@@ -287,6 +306,19 @@ Dictionary cxBaseAfterSending(const Dictionary& base, const Dictionary& sent, co
             result.remove(name);
     }
     return result;
+}
+
+void cxYieldWhatWasSent(CXMergeResult& merge, const Dictionary& sent) {
+    for (CXMergeConflict& conflict : merge.conflicts) {
+        const auto wasSent = [&](const auto& value) { return sent[value.first] == value.second; };
+        if (conflict.winner == CXSide::theirs || conflict.kept.empty() ||
+            !std::all_of(conflict.kept.begin(), conflict.kept.end(), wasSent))
+            continue;
+        for (const auto& [name, value] : conflict.kept) merge.contact.remove(name);
+        for (const auto& [name, value] : conflict.lost) merge.contact.set(name, value.deepMutableCopy());
+        std::swap(conflict.kept, conflict.lost);
+        conflict.winner = CXSide::theirs;
+    }
 }
 
 CXSide laterSide(const std::optional<Date>& ours, const std::optional<Date>& theirs, const Dictionary& ourContact,

@@ -43,8 +43,13 @@ CXMergeResult mergedContact(const std::optional<Dictionary>& base, const Diction
 
 // The base for merging with `theirs` where `sent`, a later version of ours, may have come to the other side or not. An
 // entry or single value of theirs that is as it was sent was had by both; so was an entry missing on purpose. All else
-// is as in `base`. Pure; the result shares its containers with the arguments.
+// is as in `base`. An entry that was new in `sent` and lies there says that it came: then it is the base itself. Pure;
+// the result shares its containers with the arguments.
 Dictionary cxBaseAfterSending(const Dictionary& base, const Dictionary& sent, const Dictionary& theirs);
+// Where `sent` may have come and is older than theirs, a single value of ours that it held gives way to another one of
+// theirs, whatever else was edited here since: the other side may have seen it and replaced it. It stays noted as a
+// conflict.
+void cxYieldWhatWasSent(CXMergeResult& merge, const Dictionary& sent);
 
 // The side of the later date. Of equal dates, and where one is missing, the side whose content is the greater one as
 // encoded bytes: whoever merges comes to the same.

@@ -295,7 +295,10 @@ void ApplyLoop::applyOutOfOrder() {
 void ApplyLoop::noteRefused() {
     if (_parts.denied.empty()) return;
     _parts.state.withConduitData([&](Dictionary& data) {
-        noteRefusedChanges(data, _parts.denied.all(), _parts.denied.refused(), _parts.with.clock.now());
+        noteRefusedChanges(
+            data, _parts.denied.all(), _parts.denied.refused(),
+            [&](const CXDChangeRecord& record) { return _parts.conduits.vaultra->findsAgain(record); },
+            _parts.with.clock.now());
     });
 }
 
@@ -425,6 +428,7 @@ bool ApplyLoop::applyTo(CXDConduit& conduit, int32_t source, const CXDChangeReco
     // Done with, but not remembered: the next comparison offers it again.
     if (swallowed && !ofOwnGroup && isOfAStrangeGroup(*record)) return true;
     if (!ofOwnGroup && !conduit.holds(*record)) {
+        if (source == CXDSyncSourceCX) forgetGroupThatIsListed(*record);
         if (conduit.waitsForWhatFollows(*record)) tryAgainAtTheEnd(source, record);
         return true;
     }
@@ -473,6 +477,19 @@ bool ApplyLoop::noteSwallowed(const CXDChangeRecord& record) {
     _unsettled.set(record.group()->str(), true);
     noteUnsure(*record.group());
     return true;
+}
+
+// The list of everybody names a group that is known and that the database has lost, with a list that did not name it.
+// It is announced once more.
+void ApplyLoop::forgetGroupThatIsListed(const CXDChangeRecord& record) {
+    if (record.type() != CXDAddGroupToGroup || !record.user() || !record.person() || !record.group() ||
+        cxUIDWithTableName(*record.group(), kCXGroupTable).str() != kCXAllGroupUID)
+        return;
+    _parts.state.withConduitData([&](Dictionary& data) {
+        Dictionary known =
+            data[kConduitVaultra].dictionary()[kPriorState].dictionary()[record.user()->str()].dictionary();
+        known.remove(cxUIDWithTableName(*record.person(), kCXGroupTable).str());
+    });
 }
 
 // One that the database does not have. It comes when somebody may write, unless it is taken for known before.

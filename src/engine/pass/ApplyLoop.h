@@ -50,6 +50,7 @@ private:
     void queue();                // _unhandled becomes the flat list
     CXDChangeRecords accepted();
     bool noteSwallowed(const CXDChangeRecord& record);
+    void forgetGroupThatIsListed(const CXDChangeRecord& record);
     bool isOfAStrangeGroup(const CXDChangeRecord& record) const;
     void tryAgainAtTheEnd(int32_t source, const CXDChangeRecordPtr& record);
     void split();

@@ -74,10 +74,11 @@ size_t countRefusedChanges(const Dictionary& conduitData) {
 }
 
 void noteRefusedChanges(Dictionary& conduitData, const CXDChangeRecords& dropped, const CXDChangeRecords& refused,
-                        Date now) {
+                        const FindsAgain& findsAgain, Date now) {
     const CXDChangeRecords own = ownWrites(dropped);
     if (own.empty()) return;
-    for (const CXDChangeRecordPtr& record : own) leaveToNextScan(conduitData, *record);
+    for (const CXDChangeRecordPtr& record : own)
+        if (!findsAgain(*record)) leaveToNextScan(conduitData, *record);
     Dictionary noted = conduitData.dictionaryFor(kConduitCX).dictionaryFor(kRefusedByStore);
     for (const CXDChangeRecordPtr& record : ownWrites(refused))
         noted.dictionaryFor(kDenied).set(subjectOf(*record), true);
@@ -87,7 +88,8 @@ void noteRefusedChanges(Dictionary& conduitData, const CXDChangeRecords& dropped
     noted.set(kNotBefore, now.addingSeconds(pause));
 }
 
-void holdBackRefusedChanges(Dictionary& conduitData, CXDChangeRecords& gathered, Date now) {
+void holdBackRefusedChanges(Dictionary& conduitData, CXDChangeRecords& gathered, const FindsAgain& findsAgain,
+                            Date now) {
     Dictionary noted = refusals(conduitData);
     if (noted.empty()) return;
     const auto isOwn = [](const CXDChangeRecordPtr& record) { return isOwnWrite(*record) && !isOfAccessList(*record); };
@@ -100,7 +102,7 @@ void holdBackRefusedChanges(Dictionary& conduitData, CXDChangeRecords& gathered,
     if (!allRest) noted.remove(kLeftOut);
     std::erase_if(gathered, [&](const CXDChangeRecordPtr& record) {
         if (!isOwn(record) || !(allRest || (leaveOut && concernsDenied(*record, denied)))) return false;
-        leaveToNextScan(conduitData, *record);
+        if (!findsAgain(*record)) leaveToNextScan(conduitData, *record);
         if (leaveOut) noted.set(kLeftOut, true);
         return true;
     });

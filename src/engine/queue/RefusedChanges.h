@@ -5,6 +5,7 @@
 #include "model/CXDChangeRecord.h"
 
 #include <cstddef>
+#include <functional>
 
 namespace rolvane {
 
@@ -27,14 +28,19 @@ bool hasRefusedChanges(const Dictionary& conduitData);
 // How many people and groups wait for that.
 size_t countRefusedChanges(const Dictionary& conduitData);
 
+// True of a change that no scan has to be told of, because it is found anew for as long as it is to be made: somebody
+// else may make it needless meanwhile.
+using FindsAgain = std::function<bool(const CXDChangeRecord& record)>;
+
 // Notes what a pass was refused: `dropped`, all of the denied records; `refused`, those among them that the store
 // itself has denied. Others than the owner's writes are left out. An attempt that was made while earlier refusals
 // rested does not lengthen their rest.
 void noteRefusedChanges(Dictionary& conduitData, const CXDChangeRecords& dropped, const CXDChangeRecords& refused,
-                        Date now);
+                        const FindsAgain& findsAgain, Date now);
 // Takes out of what a full pass has gathered what rests, and leaves it to the next scan. Access-list changes never
 // rest: the store keeps lists whatever it says to files, and a right that was taken back must not wait.
-void holdBackRefusedChanges(Dictionary& conduitData, CXDChangeRecords& gathered, Date now);
+void holdBackRefusedChanges(Dictionary& conduitData, CXDChangeRecords& gathered, const FindsAgain& findsAgain,
+                            Date now);
 // The end of a full pass in which nothing was refused: without anything left to send, all is forgotten.
 void settleRefusedChanges(Dictionary& conduitData, Date now);
 // The store has taken a change: it is left to no scan any more.

@@ -133,11 +133,14 @@ public:
 
     CXDChangeRecords take() { return std::move(_records); }
 
-    // The same of a composite, which says more than the name.
+    // The same of a record that says more than the name.
     void overruleNameIn(CXDChangeRecordPtr& record) const {
-        if (record->type() != CXDCompositeGroupChange || !isWrite(*record) || record->user() != _tree.user ||
-            !record->group() || !_renamedThere.contains(shared(*record->group(), kCXGroupTable)))
-            return;
+        if (record->user() != _tree.user || !record->group()) return;
+        const bool isOurs = record->type() == CXDCompositeGroupChange && isWrite(*record);
+        const bool isTheirs =
+            record->type() == CXDCreateStructureForGroup && record->initialSource() == CXDSyncSourceVaultra;
+        if (!isOurs && !isTheirs) return;
+        if (!(isOurs ? _renamedThere : _renamed).contains(shared(*record->group(), kCXGroupTable))) return;
         const Value content = record->inMemoryPayload();
         if (!content.isDictionary() || !content.dictionary().contains(kCXGroupNameProperty)) return;
         Dictionary without = content.dictionary().mutableCopy();
