@@ -138,6 +138,7 @@ private:
     void awaitStructure();                   // any thread
     void publishAgain(const TreeCondition& condition);
     void restoreAccessLists();
+    bool isBeingMended();
     bool isMended(const Dictionary& prior, const Dictionary& state);
     bool isToBePublishedAgain();
     void mendOwnTree(const Dictionary& prior, const Dictionary& state);

@@ -67,11 +67,19 @@ bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state)
     return false;
 }
 
+// What stands alone in the own tree is taken away when its time is over.
+bool CXDVaultraConduit::isBeingMended() {
+    const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
+    const Dictionary prior = users[kSelf.str()].dictionary();
+    return prior.contains(kNamesAlone) || prior.contains(kUnlistedContacts);
+}
+
 // None where nobody can tell, or something is to be done to the tree whatever lies there.
 std::optional<CXDVaultraConduit::Comparison> CXDVaultraConduit::comparisonWith(const UserName& user, const Url& base,
                                                                                bool ask) {
     const auto states = engine().stateGeneration();
-    if (!states || (user == kSelf && !engine().conduitObjectForKey(kConduitCX, kPublishAgain).empty()))
+    if (!states ||
+        (user == kSelf && (isBeingMended() || !engine().conduitObjectForKey(kConduitCX, kPublishAgain).empty())))
         return std::nullopt;
     const auto tree = _world.manager.markOfTree(base, ask);
     return tree ? std::optional(Comparison{_world.rolvane.journalPosition(), *states, *tree}) : std::nullopt;
