@@ -276,6 +276,37 @@ TEST(VersionMemory, CountsForTheDatabaseThatHasWhatWasReadAndNotForAnEarlierStat
     EXPECT_FALSE(isKnownTo({8, 3})) << "another database";
 }
 
+// All rows at once behind a longer head, and no end.
+TEST(VersionMemory, ReadsTheFileOfAnEarlierVersionAndWritesItsOwn) {
+    TempDirectory directory;
+    const FileVersion v{EntityTag("\"a\""), Date(1000), 5};
+    const VersionMemory::Owner owner{7, 3};
+    {
+        VersionMemory m(directory / "now");
+        for (const char* url : {"u", "w"}) m.read(url, v);
+        m.save(owner);
+    }
+    const std::string now = readFile(directory / "now");
+    constexpr size_t kRow = 32, kHead = 12;
+    const std::string end = now.substr(now.size() - kRow);
+    const std::string rows = now.substr(kHead, now.size() - kHead - kRow);
+    std::ofstream(directory / "v", std::ios::binary)
+        << "RVM3" << end.substr(0, 8) << end.substr(16, 8) << now.substr(4, 8) << rows;
+    {
+        VersionMemory m(directory / "v");
+        m.belongTo(owner);
+        EXPECT_TRUE(m.knows("u", v) && m.knows("w", v));
+        m.read("x", v);
+        m.save({7, 4});
+    }
+    VersionMemory again(directory / "v");
+    again.belongTo({7, 4});
+    EXPECT_TRUE(again.knows("u", v) && again.knows("w", v) && again.knows("x", v));
+    EXPECT_TRUE(readFile(directory / "v").starts_with("RVM4"));
+    std::ofstream(directory / "v", std::ios::binary) << "RVM3 and no more";
+    EXPECT_FALSE(VersionMemory(directory / "v").knows("u", v));
+}
+
 TEST(VersionMemory, GoesBackToWhatWasSavedLast) {
     TempDirectory directory;
     const FileVersion v{EntityTag("\"a\""), Date(1000), 5};

@@ -21,6 +21,8 @@ constexpr size_t kRow = 32;          // bytes in the file
 constexpr size_t kDigestLength = 28; // of a SHA-1 in base64
 constexpr char kMagic[4] = {'R', 'V', 'M', '4'};
 constexpr size_t kHead = 12;
+constexpr char kFormerMagic[4] = {'R', 'V', 'M', '3'};
+constexpr size_t kFormerHead = 28;
 constexpr uint64_t kEnd = 4;                         // the kind of the row that ends a save
 constexpr uint64_t kSum = 0xcbf29ce484222325u;       // the sum of nothing
 constexpr std::string_view kClockFile = "/dateFile"; // which the owner of a tree touches with each pass
@@ -100,7 +102,21 @@ void VersionMemory::load() {
     }
 }
 
+// An earlier version wrote all rows at once, without an end. The next save writes the file anew.
+void VersionMemory::takeFormerRows(const std::string& text) {
+    if (text.size() < kFormerHead || (text.size() - kFormerHead) % kRow != 0) return;
+    memcpy(&_owner.identity, text.data() + 4, 8);
+    memcpy(&_owner.passes, text.data() + 12, 8);
+    memcpy(&_seed, text.data() + 20, 8);
+    for (size_t at = kFormerHead; at < text.size() && _entries.size() < _capacity; at += kRow) {
+        uint64_t row[4];
+        memcpy(row, text.data() + at, sizeof row);
+        if (row[1] >= 1 && row[1] < kEnd) _entries[row[0]] = {static_cast<Kind>(row[1]), row[2], row[3]};
+    }
+}
+
 void VersionMemory::takeRows(const std::string& text) {
+    if (text.size() >= 4 && memcmp(text.data(), kFormerMagic, 4) == 0) return takeFormerRows(text);
     if (text.size() < kHead || memcmp(text.data(), kMagic, 4) != 0) return;
     struct stat file {};
     if (stat(_path.c_str(), &file) != 0) return;

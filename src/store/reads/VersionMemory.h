@@ -69,6 +69,7 @@ private:
     void need(); // the file is read
     void load();
     void takeRows(const std::string& text);
+    void takeFormerRows(const std::string& text);
     void judge(const Owner& owner);
     void put(std::string_view url, Entry entry);
     void erase(std::string_view url);
