@@ -46,6 +46,22 @@ TEST_F(UnchangedTrees, AnEditIsSentWithSixRequestsAndAReadWhereOthersMayWrite) {
     EXPECT_EQ(copies(), alice.view());
 }
 
+// The cache that knows them is gone. What lies in a tree that nobody else writes to is no news, and is not read.
+TEST_F(UnchangedTrees, VersionsThatAreForgottenAreNotReadAnewWhereNobodyElseWrites) {
+    alice.application->allGroup()->setValue(CXMutableMultiValue(), kCXReadWriteSharingACLProperty);
+    alice.application->save();
+    for (int pass = 0; pass < 3; ++pass) alice.pass();
+    for (const CXPersonRef& person : people)
+        alice.manager.forgetVersion(Url(alice.base)
+                                        .cxURLByAppendingComponent("People")
+                                        .cxURLByAppendingComponent(CXACLManager::bucketNameForUID(person->uniqueId()))
+                                        .cxURLByAppendingComponent(person->uniqueId().str()));
+    alice.wire->clear();
+    for (int pass = 0; pass < 2; ++pass) alice.pass();
+    EXPECT_EQ(alice.reads("People"), 0u) << alice.wire->text();
+    EXPECT_EQ(alice.countPeople(), people.size());
+}
+
 TEST_F(UnchangedTrees, EveryKindOfChangeArrives) {
     settle();
     writeElsewhere(people[1], "Benjamin");

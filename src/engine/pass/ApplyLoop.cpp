@@ -52,10 +52,11 @@ Dictionary unsettledOwnGroups(const CXDChangeRecords& records, size_t fresh) {
 // Tells the file managers what the apply loop is going to read, and that it has ended.
 class ReadingAhead {
 public:
-    explicit ReadingAhead(const CXDChangeRecords& records) {
+    ReadingAhead(const CXDChangeRecords& records, const CXDConduit& database) {
         std::vector<Url> urls;
         for (const CXDChangeRecordPtr& record : records) {
             if (!(record->appliesToSources() & CXDSyncSourceCX) || !record->delayedPayloadURL()) continue;
+            if (database.swallows(*record)) continue;
             if (!_manager) _manager = record->fileManager();
             if (record->fileManager() != _manager) continue;
             urls.push_back(*record->delayedPayloadURL());
@@ -312,7 +313,7 @@ void ApplyLoop::takeInMerged() {
 
 void ApplyLoop::applyInOrder() {
     constexpr size_t kFew = 50;
-    const ReadingAhead ahead(_inOrder);
+    const ReadingAhead ahead(_inOrder, *_parts.conduits.cx);
     for (; _inOrderDone < _inOrder.size(); ++_inOrderDone) {
         const CXDChangeRecordPtr record = _inOrder[_inOrderDone]; // there may be more on the way
         if (_inOrderDone == ahead.lastBut(kFew) && !_parts.terminating) _parts.conduits.vaultra->willClose();
