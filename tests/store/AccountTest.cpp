@@ -329,7 +329,7 @@ TEST(VersionMemory, ASaveWritesWhatHasChangedAndNotTheWhole) {
     for (int pass = 2; pass < 100; ++pass) {
         m.read("edited", version(pass));
         if (pass == 50) m.forget("17");
-        m.save({7, pass});
+        m.save({7, static_cast<uint64_t>(pass)});
     }
     EXPECT_LT(std::filesystem::file_size(directory / "v") - whole, 100u * 3 * 32);
     VersionMemory again(directory / "v");
