@@ -7,6 +7,7 @@
 #include <algorithm>
 #include <future>
 #include <gtest/gtest.h>
+#include <map>
 #include <thread>
 
 using namespace rolvane;
@@ -263,8 +264,11 @@ TEST_F(ReadingEarly, AListingThatWasBegunAsksNothingTwiceAndServesOneListing) {
     Client fresh(*world); // nobody has told it yet that the store tells changes
     fresh.manager.expectListing(fresh.base);
     const auto begun = fresh.manager.infoForFilesInContainer(fresh.base);
-    const size_t asked = fresh.wire->count("PROPFIND");
-    EXPECT_EQ(asked, 35u) << "the token, and 34 collections\n" << fresh.wire->text();
+    std::map<std::string, size_t> asked; // the tree itself is asked for its token, too, where that is known in time
+    for (const auto& exchange : fresh.wire->exchanges())
+        if (exchange.method == "PROPFIND") ++asked[exchange.path];
+    EXPECT_EQ(asked.size(), 34u) << fresh.wire->text();
+    for (const auto& [path, times] : asked) EXPECT_LE(times, path.ends_with("/Contacts/") ? 2u : 1u) << path;
     fresh.wire->clear();
     Client other(*world);
     ASSERT_EQ(other.write("People/7/new:CXPerson", Dictionary{{"number", 1}}), 201);

@@ -1,5 +1,6 @@
 #include "conduits/database/ContactWrites.h"
 
+#include "conduits/PublishedLayout.h"
 #include "conduits/store/CXDVaultraConduit.h"
 #include "contacts/records/Constants.h"
 #include "contacts/records/Identifier.h"
@@ -29,15 +30,17 @@ std::shared_ptr<const Bytes> encoded(const Dictionary& contact) {
     return std::make_shared<const Bytes>(BinaryValue::encode(contact));
 }
 
-// A refusal of a question is none of the edit.
-void refuseNothing(int& code) {
-    if (code == kForbidden) code = 0;
-}
-
 } // namespace
 
 Dictionary cxAsSent(const Dictionary& contact) {
     return PropertyList::fromXML(PropertyList::toXML(contact)).dictionary();
+}
+
+int cxAfterQuestion(CXDAVManager& manager, const Url& base, int code) {
+    if (code != kForbidden) return code;
+    int ofTree = 0;
+    manager.dictionaryAtURL(base.cxURLByAppendingComponent(layout::kInfo), &ofTree, false);
+    return ofTree == kForbidden ? kForbidden : 0;
 }
 
 CXMergeResult cxMergedWithStore(const std::optional<CXCommonVersion>& common, const Dictionary& here,
@@ -90,7 +93,7 @@ bool ContactWrites::writeOver(const Place& place, const Dictionary& ours, int& c
     for (int attempt = 0; attempt < kAttempts; ++attempt) {
         const auto there = _manager.readVersion(place.location, CXDVaultraConduit::kSecureRecordWrites, &code);
         if (there.failed) {
-            refuseNothing(code);
+            code = cxAfterQuestion(_manager, place.base, code);
             return false;
         }
         if (!there.contact) {
@@ -110,10 +113,11 @@ bool ContactWrites::writeOver(const Place& place, const Dictionary& ours, int& c
 // the edit waits.
 bool ContactWrites::writeWhereNoneIs(const Place& place, const Dictionary& ours, int& code) {
     if (place.wasListed && place.wasListed()) {
-        const auto list = _manager.dictionaryAtURL(place.list, CXDVaultraConduit::kSecureRecordWrites, &code);
+        const Url everybody = layout::groupLocation(place.base, UniqueId(std::string(layout::kAllGroup)));
+        const auto list = _manager.dictionaryAtURL(everybody, CXDVaultraConduit::kSecureRecordWrites, &code);
         const Value members = list ? (*list)[kMemberUIDState] : Value();
         if (!members.isArray()) {
-            refuseNothing(code);
+            code = cxAfterQuestion(_manager, place.base, code);
             return false;
         }
         if (!members.array().containsString(cxNormalizedUID(place.uniqueId).str())) {

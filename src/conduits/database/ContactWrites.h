@@ -18,6 +18,10 @@ class CXDAVManager;
 
 // The contact as it comes back from a store: dates to the second, for instance.
 Dictionary cxAsSent(const Dictionary& contact);
+// What a question's status says of the change that it was asked for. 403 is a refusal of the change where the tree is
+// closed altogether, which its information tells; else it is one of the question alone, and the change waits: 0.
+int cxAfterQuestion(CXDAVManager& manager, const Url& base, int code);
+
 // Merges `here`, as it is sent, with `there` against the last version that the database and the store have had in
 // common, and against what has been on its way since. `common`: none where nothing is known of it. `written`: when
 // `there` was put there, to the second, as the store has it.
@@ -46,12 +50,13 @@ public:
     void willWrite(const Url& location, const UniqueId& uniqueId, const std::function<Dictionary()>& content);
 
     struct Place {
-        UserName user;                   // of the tree
-        Url location;                    // of the contact's file
-        UniqueId uniqueId;               // of the contact in the database
-        bool merges;                     // others may have written there, and what they wrote may be taken in here
-        Url list;                        // the tree's list of everybody
-        std::function<bool()> wasListed; // whether that list is known to have named the contact; asked at most once
+        UserName user;     // of the tree
+        Url location;      // of the contact's file
+        UniqueId uniqueId; // of the contact in the database
+        bool merges;       // others may have written there, and what they wrote may be taken in here
+        Url base;          // of the tree
+        std::function<bool()>
+            wasListed; // whether the list of everybody is known to have named the contact; asked at most once
     };
     // True when the store has the content afterwards, alone or merged, and when somebody else has deleted the contact:
     // its file is gone and the list that named it does not any more. `code`: the last answer's status; 412 when

@@ -107,16 +107,11 @@ bool CXDVaultraConduit::updateRecord(CXDChangeRecord& record, int& code) {
     if (!base || !record.person()) return false;
     const UserName user = record.user().value_or(UserName());
     const UniqueId shared = cxNormalizedUID(*record.person()), everybody{std::string(layout::kAllGroup)};
-    const ContactWrites::Place place{user,
-                                     layout::contactLocation(*base, *record.person()),
-                                     inDatabase(record),
-                                     mergesInto(user),
-                                     layout::groupLocation(*base, everybody),
-                                     [&] {
-                                         const Dictionary list =
-                                             engine().knownGroupState(kConduitVaultra, user, everybody);
-                                         return list[kMemberUIDState].array().containsString(shared.str());
-                                     }};
+    const ContactWrites::Place place{
+        user, layout::contactLocation(*base, *record.person()), inDatabase(record), mergesInto(user), *base, [&] {
+            const Dictionary list = engine().knownGroupState(kConduitVaultra, user, everybody);
+            return list[kMemberUIDState].array().containsString(shared.str());
+        }};
     return _writes.write(place, contentOf(record), code);
 }
 
@@ -179,10 +174,10 @@ bool CXDVaultraConduit::makeCompositeGroupChange(CXDChangeRecord& record, int& c
     if (!state && (code == kMissing || code == kOk)) state = lastKnownState(record);
     const Dictionary changed = layout::groupStateAfterComposite(state.value_or(Dictionary()), contentOf(record));
     // A state that is there and could not be read is not replaced by a part of it: the client then sends no write, and
-    // the answer to the read stands. A refusal of the question is none of the change.
+    // the answer to the read stands.
     int written = 0;
     const bool done = _world.manager.write(stringForDictionary(changed), location, kSecureRecordWrites, &written);
-    if (written != 0 || code == kForbidden) code = written;
+    code = written != 0 ? written : cxAfterQuestion(_world.manager, *base, code);
     return done;
 }
 
