@@ -146,14 +146,16 @@ size_t filesBelow(const std::string& directory) {
 void removeUser(Context& context, const StoreOptions& options) {
     PrivateStore store(knownOptions(options));
     const std::vector<std::string> users = store.users();
-    const CommandError unknown(kNotFound, fmt::format("The store has no user {}.", options.user));
-    if (std::find(users.begin(), users.end(), options.user) == users.end()) throw unknown;
+    const auto unknown = [&] {
+        return CommandError(kNotFound, fmt::format("The store has no user {}.", options.user));
+    };
+    if (std::find(users.begin(), users.end(), options.user) == users.end()) throw unknown();
     const std::string directory = store.userDirectory(options.user);
     requireConsent(context, options.yes,
                    fmt::format("Take the account of {} away? {} of it stay in {}, and nobody signs in as {} any more.",
                                options.user, counted(filesBelow(directory), "file", "files"), directory, options.user),
                    "The account stays.");
-    if (!store.removeUser(options.user)) throw unknown;
+    if (!store.removeUser(options.user)) throw unknown();
     context.say(fmt::format("{} can no longer sign in.", options.user));
 }
 
