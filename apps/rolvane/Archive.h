@@ -8,7 +8,7 @@
 
 namespace rolvane::cli {
 
-// What is known of a member of an archive.
+// A member of an archive, as it is known.
 struct ArchivedFile {
     uint64_t offset = 0, size = 0; // bytes
     std::string sha256;            // hexadecimal, small letters

@@ -10,11 +10,11 @@
 
 namespace rolvane::cli {
 
-// What a person has on this computer, in one file: contact database, account, preferences, and the contacts that
+// One file with all that a person has on this computer: contact database, account, preferences, and the contacts that
 // publishers have withdrawn. docs/formats.md has its members. No password is in it, nor the private store, nor the
 // address books' devices.
 
-// What a backup says of itself.
+// The words of a backup about itself.
 struct BackupFacts {
     Date date;
     std::string computer, version; // that made it

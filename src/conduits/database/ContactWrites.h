@@ -18,7 +18,7 @@ class CXDAVManager;
 
 // The contact as it comes back from a store: dates to the second, for instance.
 Dictionary cxAsSent(const Dictionary& contact);
-// What a question's status says of the change that it was asked for. 403 is a refusal of the change where the tree is
+// The status of a question, as it counts for the change that it was asked for. 403 refuses the change where the tree is
 // closed altogether, which its information tells; else it is one of the question alone, and the change waits: 0.
 int cxAfterQuestion(CXDAVManager& manager, const Url& base, int code);
 

@@ -67,7 +67,7 @@ bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state)
     return false;
 }
 
-// What stands alone in the own tree is taken away when its time is over.
+// Halves and leftovers in the own tree are taken away when their time is over.
 bool CXDVaultraConduit::isBeingMended() {
     const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
     const Dictionary prior = users[kSelf.str()].dictionary();
