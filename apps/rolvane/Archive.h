@@ -24,7 +24,7 @@ public:
     ArchiveWriter(const ArchiveWriter&) = delete;
     ArchiveWriter& operator=(const ArchiveWriter&) = delete;
 
-    // The name has 100 bytes at most. Gives the size and the digest of what was written.
+    // The name has 100 bytes at most. Gives the size and the digest of the written content.
     ArchivedFile addText(const std::string& name, std::string_view text);
     ArchivedFile addFile(const std::string& name, const std::string& path);
     void finish();  // the end mark; the bytes are on the disk then, still under the temporary name
@@ -52,7 +52,7 @@ public:
     ArchiveReader(const ArchiveReader&) = delete;
     ArchiveReader& operator=(const ArchiveReader&) = delete;
 
-    const std::map<std::string, ArchivedFile>& members() const { return _members; } // with digests of what is there
+    const std::map<std::string, ArchivedFile>& members() const { return _members; } // with digests of their contents
     bool has(const std::string& name) const { return _members.contains(name); }
     std::string text(const std::string& name, size_t most = 16U << 20) const;
     void extract(const std::string& name, const std::string& to) const; // a new file of mode 0600, on the disk then

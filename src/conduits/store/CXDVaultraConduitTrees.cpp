@@ -131,7 +131,7 @@ void CXDVaultraConduit::mendOwnTree(const Dictionary& prior, const Dictionary& s
 }
 
 // Contacts that no list names. One that the list has named until now has been deleted by somebody, and goes at once.
-// Whoever wrote another one may still list it, so it is given its time.
+// The writer of another one may still list it, so it is given its time.
 void CXDVaultraConduit::takeUnlistedAway(Dictionary prior, const Dictionary& state) {
     _leftovers = removalOfUnlisted(prior, state);
     const Date now = _world.clock.now();

@@ -135,8 +135,8 @@ public:
     // One request when all is there. With `create` what is missing is made; nothing that exists is written again.
     // True when the structure is complete afterwards.
     bool sanityCheckPublishStructureCreate(bool create);
-    // What is known of a tree by listing it: equal numbers say that neither the store nor this client's knowledge of
-    // its versions has changed, but for the clock file. Only in this process.
+    // A mark of a listed tree: equal numbers say that neither the store nor this client's knowledge of the tree's
+    // versions has changed, but for the clock file. Only in this process.
     struct TreeMark {
         uint64_t listing = 0, versions = 0;
         bool operator==(const TreeMark&) const = default;
