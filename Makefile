@@ -55,7 +55,7 @@ board: build
 	build/release/tests/board --seeds $(BOARD_SEEDS) --seconds $(BOARD_SECONDS) --jobs $(JOBS) --table docs/reliability.md
 
 interop: build
-	@packaging/setup build test interop
+	@packaging/setup build test interop pictures
 	tests/interop/all build/release docs/servers.md
 
 pictures: build

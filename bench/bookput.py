@@ -2,7 +2,8 @@
 """usage: bookput.py BUILD [PEOPLE] [EDITS]
 
 How long an edit takes from a CardDAV client's PUT until the store has it, of somebody who publishes so many people, with
-the daemon at work and nobody saying `sync`. Exit code 1 when the median is over a second."""
+the daemon at work and nobody saying `sync`. The first edit comes while the daemon looks at the tree that it has just made.
+Exit code 1 when one takes over a second."""
 
 import os
 import re
@@ -71,8 +72,8 @@ def main(build, people=100000, edits=20):
         if not times:
             raise Failure("there was no card to change")
         print(f"PUT of a card to the store, {people} people published, {len(times)} edits: median "
-              f"{1000 * statistics.median(times):.0f} ms, longest {1000 * max(times):.0f} ms")
-        return 0 if statistics.median(times) <= MOST_SECONDS else 1
+              f"{1000 * statistics.median(times):.0f} ms, first {1000 * times[0]:.0f} ms, longest {1000 * max(times):.0f} ms")
+        return 0 if max(times) <= MOST_SECONDS else 1
 
 
 if __name__ == "__main__":

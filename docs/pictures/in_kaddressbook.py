@@ -1,5 +1,6 @@
 """KAddressBook's windows, from the first one to the shared contacts. Its books are read by a service of its own (Akonadi)."""
 
+import contextlib
 import os
 import re
 import subprocess
@@ -12,13 +13,20 @@ SERVICES = [f"/usr/share/dbus-1/services/{name}.service" for name in (
 
 
 def kaddressbook(person, target):
+    with opened(person) as screen:
+        walk(person, screen, target, "shared-")
+
+
+@contextlib.contextmanager
+def opened(person):
+    """A screen for it, and an end to its services."""
     # A person who has used the program before has answered whether passwords are kept in a wallet; here they are not.
     with open(os.path.join(person.environment["XDG_CONFIG_HOME"], "kwalletrc"), "w") as out:
         out.write("[Wallet]\nEnabled=false\nFirst Use=false\n")
     screen = Screen(person, SERVICES)
     screen.environment["QT_QPA_PLATFORM"] = "xcb"
     try:
-        walk(person, screen, target)
+        yield screen
     finally:
         screen.tool("akonadictl", "stop")  # its processes end behind it, at the latest with their bus
         screen.stop()
@@ -37,7 +45,8 @@ def titled(screen, pattern, behind=None):
     return screen.fail(f"no window {pattern}")
 
 
-def walk(person, screen, target):
+def walk(person, screen, target, book):
+    """From the first window to the contacts; `book`: how the book begins whose cards have to be asked for."""
     def picture(name):
         screen.picture(os.path.join(target, f"kaddressbook-{name}.png"))
 
@@ -81,7 +90,7 @@ def walk(person, screen, target):
     screen.key("alt+o")  # OK
     titled(screen, "^DAV Resource Configuration")
     screen.key("alt+o")
-    screen.wait_for_line(asked, r"REPORT 207 .*/shared-", "KAddressBook never asked for the shared cards")
+    screen.wait_for_line(asked, rf"REPORT 207 .*/{book}", f"KAddressBook never asked for the cards of {book}")
     titled(screen, "^KAddressBook")
     # The list is wider with its right edge drawn aside.
     screen.tool("xdotool", "mousemove", "258", "395", "mousedown", "1", "mousemove", "300", "395", "mousemove", "480", "395",

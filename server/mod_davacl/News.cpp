@@ -10,7 +10,7 @@ namespace rolvane::davacl {
 namespace {
 
 // The name says how the ring's memory is laid out: another version of the module makes its own.
-constexpr const char* kRetained = "davacl-news-1";
+constexpr const char* kRetained = "davacl-news-2";
 constexpr const char* kClockFile = "dateFile";
 
 struct Retained {

@@ -52,7 +52,9 @@ private:
         std::atomic<uint64_t> number = 0; // its note's position, plus one; 0 while it is being written
         std::atomic<uint64_t> tree = 0, writer = 0;
     };
-    static constexpr size_t kSlots = 16384;
+    // Enough for the first publication of 100,000 people, with two notes for each file: whoever has made it is then
+    // told of nothing, and does not list all of it again. 6 MB, shared by all processes.
+    static constexpr size_t kSlots = size_t{1} << 18;
     using Block = std::array<unsigned char, 16>;
     std::optional<Block> ciphered(const Block& block, bool encrypts) const;
 

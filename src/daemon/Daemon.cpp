@@ -20,6 +20,7 @@
 #include "daemon/OwnPasses.h"
 #include "daemon/StoreNewsRequest.h"
 #include "daemon/TerminationWatch.h"
+#include "daemon/TreesAhead.h"
 #include "engine/CXDSyncEngine.h"
 #include "engine/pass/OutcomeKeeper.h"
 #include "engine/pass/StoreFailures.h"
@@ -148,7 +149,8 @@ private:
             _processEnd, *_account, IdleExit::process(), [](const Url& url) { return CXWebDAVLock::initWithURL(url); },
             [this, &store](ConduitEngine& owner) { return makeConduits(owner, store); }, loginUserName(), nullptr,
             [&store] { releaseLocksOfEndedRuns(store); }, [&store] { return takeFailures(store); },
-            [this](const PassOutcome& outcome) {
+            [this, &store](const PassOutcome& outcome) {
+                _basesRead = basesOf(outcome, store.account());
                 if (_ownPasses) _ownPasses->passEnded(resultOf(outcome));
                 if (_news) _news->passEnded(resultOf(outcome), treesOf(outcome));
             }});
@@ -173,6 +175,8 @@ private:
             return _news && _news->isLive() ? OwnPasses::lookIntervalWithNews(lookInterval()) : lookInterval();
         };
         world.askStore = [&store] { return askStore(store); };
+        _treesAhead.emplace(_loop, store);
+        world.prepare = [this](std::function<void()> done) { return _treesAhead->begin(_basesRead, std::move(done)); };
         world.pass = [] { ownPass(); };
         world.networkIsBack = [this] {
             NotificationCenter::defaultCenter().post({kCXNetworkConfigurationDidChangeNotification, std::nullopt, {}});
@@ -218,6 +222,14 @@ private:
         for (const PassTree& tree : outcome.trees)
             if (!tree.ended) trees.emplace_back(tree.location);
         return trees;
+    }
+
+    // As the passes name them.
+    static std::vector<Url> basesOf(const PassOutcome& outcome, const CXDAVAccount& account) {
+        std::vector<Url> bases;
+        for (const PassTree& tree : outcome.trees)
+            if (!tree.ended) bases.push_back(account.baseLocationFor(tree.user == kSelf ? account.user : tree.user));
+        return bases;
     }
 
     static double lookInterval() {
@@ -299,7 +311,9 @@ private:
     ObservationHandle _networkChanged;
     std::optional<OwnPasses> _ownPasses; // none in a process that ends when it is idle
     std::optional<BootTimer> _timer, _newsTimer;
-    std::optional<NewsWatch> _news; // as _ownPasses
+    std::optional<NewsWatch> _news;        // as _ownPasses
+    std::optional<TreesAhead> _treesAhead; // as _ownPasses
+    std::vector<Url> _basesRead;           // of the trees that the last pass was about
     std::mt19937 _random{std::random_device()()};
     std::optional<SleepWatch> _sleep;
     RunLoop::Handle _terminated;

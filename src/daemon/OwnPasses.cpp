@@ -24,7 +24,11 @@ void OwnPasses::lookIntervalChanged() {
 
 void OwnPasses::arm() {
     const auto next = _schedule.next(_world.lookInterval());
-    _world.wakeAt(next ? std::optional(next->at) : std::nullopt);
+    _world.wakeAt(next && !waitsForPreparation(next->what) ? std::optional(next->at) : std::nullopt);
+}
+
+bool OwnPasses::waitsForPreparation(RetrySchedule::What what) const {
+    return _preparing && what == RetrySchedule::What::pass;
 }
 
 void OwnPasses::passEnded(const PassResult& pass) {
@@ -38,12 +42,23 @@ void OwnPasses::networkChanged() {
 }
 
 void OwnPasses::wake() {
+    doWhatIsDue(false);
+}
+
+void OwnPasses::doWhatIsDue(bool prepared) {
     struct Rearmed { // whatever way a pass ends
         OwnPasses& own;
         ~Rearmed() { own.arm(); }
     } rearmed{*this};
     const auto next = _schedule.next(_world.lookInterval());
-    if (!next || next->at > _world.now()) return;
+    if (!next || next->at > _world.now() || waitsForPreparation(next->what)) return;
+    if (next->what == RetrySchedule::What::pass && !prepared && _world.prepare) {
+        _preparing = _world.prepare([this] {
+            _preparing = false;
+            doWhatIsDue(true);
+        });
+        if (_preparing) return;
+    }
     _schedule.beginsAttempt(_world.now());
     if (next->what == RetrySchedule::What::pass) return _world.pass();
     const bool asks = next->what == RetrySchedule::What::ask;

@@ -31,6 +31,9 @@ public:
         std::function<Answer()> askStore;
         std::function<void()> pass;            // a full pass, now
         std::function<Answer()> networkIsBack; // asks, and makes the pass where the store is there
+        // Begins what the next pass would have to wait for long: edits are carried meanwhile. False, and nothing is
+        // called, where there is no such thing; else `done` comes on the main thread, later, and always. May be empty.
+        std::function<bool(std::function<void()> done)> prepare = {};
     };
     explicit OwnPasses(World world) : _world(std::move(world)) {}
 
@@ -42,8 +45,11 @@ public:
 
 private:
     void arm();
+    void doWhatIsDue(bool prepared);
+    bool waitsForPreparation(RetrySchedule::What what) const;
     World _world;
     RetrySchedule _schedule;
+    bool _preparing = false;
 };
 
 } // namespace rolvane

@@ -269,7 +269,15 @@ struct OwnPassesInAWorld : testing::Test {
             if (there) own.passEnded(fine());
             return OwnPasses::Answer{there, 0};
         },
+        [this](std::function<void()> whenDone) {
+            if (isPrepared) return false;
+            done.emplace_back("prepare");
+            prepared = std::move(whenDone);
+            return true;
+        },
     }};
+    bool isPrepared = true;
+    std::function<void()> prepared;
     void sleepUntilWoken() {
         ASSERT_TRUE(wakes);
         now = std::max(now, *wakes);
@@ -341,4 +349,41 @@ TEST_F(OwnPassesInAWorld, AnExceptionOutOfAPassLeavesTheNextOneDue) {
     now = *wakes;
     EXPECT_THROW(failing.wake(), std::runtime_error);
     EXPECT_EQ(wakes, now + RetrySchedule::kFirstPause);
+}
+
+TEST_F(OwnPassesInAWorld, MakeAPassWhenItIsPreparedAndNotBefore) {
+    own.passEnded(fine());
+    isPrepared = false;
+    sleepUntilWoken();
+    EXPECT_EQ(done, std::vector<std::string>{"prepare"});
+    EXPECT_EQ(wakes, std::nullopt);
+    now += 3;
+    PassResult edit; // carried meanwhile
+    own.passEnded(edit);
+    EXPECT_EQ(wakes, std::nullopt) << "it is not prepared twice";
+    own.wake();
+    EXPECT_EQ(done, std::vector<std::string>{"prepare"});
+    prepared();
+    EXPECT_EQ(done, (std::vector<std::string>{"prepare", "pass"}));
+    EXPECT_EQ(wakes, now + kLook);
+}
+
+TEST_F(OwnPassesInAWorld, MakeNoPassThatSomebodyElseHasMadeWhileItWasPrepared) {
+    own.passEnded(fine());
+    isPrepared = false;
+    sleepUntilWoken();
+    own.passEnded(fine());
+    prepared();
+    EXPECT_EQ(done, std::vector<std::string>{"prepare"});
+    EXPECT_EQ(wakes, now + kLook);
+}
+
+TEST_F(OwnPassesInAWorld, HeedTheNetworkWhileAPassIsPrepared) {
+    own.passEnded(fine());
+    isPrepared = false;
+    sleepUntilWoken();
+    own.networkChanged();
+    EXPECT_EQ(wakes, now);
+    sleepUntilWoken();
+    EXPECT_EQ(done, (std::vector<std::string>{"prepare", "network"}));
 }

@@ -342,7 +342,10 @@ TEST(NewsRing, ForgetsOldNotesAndSaysSo) {
     ASSERT_EQ(two.notes.size(), 2U);
     EXPECT_EQ(two.notes[1].tree, 8U);
     EXPECT_EQ(two.next, begin + 2);
-    for (int i = 0; i < 20000; ++i) ring->post({9, 3});
+    constexpr size_t kOfAPublication = 220000; // 100,000 people, a tenth in groups, two notes each
+    for (size_t i = 0; i < kOfAPublication; ++i) ring->post({9, 3});
+    EXPECT_EQ(ring->from(begin).notes.size(), kOfAPublication + 2) << "somebody else's is found among them";
+    for (size_t i = 0; i < kOfAPublication; ++i) ring->post({9, 3});
     EXPECT_FALSE(ring->from(begin).some);
     EXPECT_TRUE(ring->from(ring->position()).some);
     EXPECT_FALSE(ring->from(ring->position() + 1).some);

@@ -258,6 +258,22 @@ void CXDAVManager::expectListing(const Url& url) {
     _impl->begunListings.insert_or_assign(url.absoluteString(), std::move(begun));
 }
 
+bool CXDAVManager::isToBeListed(const Url& tree) const {
+    return _impl->session.maySynchronize() && _impl->listings.token(tree).empty();
+}
+
+// Nothing of it counts for the versions that are known: what a pass finds out of them is stored with the pass.
+std::unique_ptr<ListingMemory> CXDAVManager::listAhead(const Url& tree) {
+    VersionMemory unused;
+    auto listed = std::make_unique<ListingMemory>();
+    return StoreListing(_impl->session, unused, *listed).list(tree) ? std::move(listed) : nullptr;
+}
+
+bool CXDAVManager::keepListing(const Url& tree, std::unique_ptr<ListingMemory> listed) {
+    if (listed) _impl->listings.takeOver(tree, std::move(*listed));
+    return !_impl->listings.token(tree).empty();
+}
+
 void CXDAVManager::expectNothing() {
     _impl->files.expectNoReads();
     const std::lock_guard guard(_impl->begunLock);

@@ -17,6 +17,8 @@
 
 namespace rolvane {
 
+class ListingMemory;
+
 // Why the store cannot be used. `code` 0: no error was produced.
 struct CXDAVError {
     int code = 0;
@@ -115,6 +117,13 @@ public:
     void expectSomeReads(const std::vector<Url>& urls, bool securely) override;
     // The container is going to be listed once, soon: what is asked first of the store is asked now.
     void expectListing(const Url& url);
+    // A tree that the next pass would list whole may be listed before it, while other passes write: the next listing
+    // then asks for the changes since alone. False also where the store tells no changes, as nothing would be kept.
+    bool isToBeListed(const Url& tree) const;
+    // Lists it, and waits for the store. Null when that could not be done. Any thread.
+    std::unique_ptr<ListingMemory> listAhead(const Url& tree);
+    // Keeps such a listing, unless the tree was listed meanwhile. False: the tree is to be listed all the same.
+    bool keepListing(const Url& tree, std::unique_ptr<ListingMemory> listed);
     // Nothing is expected any more, listings included; what was fetched ahead is forgotten.
     void expectNothing();
 

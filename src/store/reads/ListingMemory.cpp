@@ -1,5 +1,7 @@
 #include "store/reads/ListingMemory.h"
 
+#include <utility>
+
 namespace rolvane {
 
 ListingMemory::Container ListingMemory::packed(const Entries& entries) {
@@ -64,6 +66,19 @@ void ListingMemory::forgetBelow(const Url& container) {
         if (goes) _bytes -= each.second.bytes();
         return goes;
     });
+}
+
+void ListingMemory::takeOver(const Url& tree, ListingMemory&& from) {
+    const std::string token = from.token(tree);
+    if (token.empty() || !this->token(tree).empty()) return;
+    forgetBelow(tree);
+    {
+        const std::scoped_lock guard(_mutex, from._mutex);
+        if (_bytes + from._bytes > kMostBytes) return;
+        _bytes += std::exchange(from._bytes, 0);
+        _containers.merge(from._containers);
+    }
+    keepToken(tree, token);
 }
 
 void ListingMemory::keepToken(const Url& tree, const std::string& token, bool isAnother) {

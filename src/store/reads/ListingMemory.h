@@ -28,6 +28,8 @@ public:
 
     void forgetAll();
     void forgetBelow(const Url& container); // the container, whatever lies below it, and its token
+    // Takes over what another memory has of a tree, which has a token there. Nothing where this one has a token for it.
+    void takeOver(const Url& tree, ListingMemory&& from);
 
     // Up to where the containers of a tree are known (RFC 6578): those that are kept with the tag kSynced are as the
     // token says. Goes with anything of the memory.
