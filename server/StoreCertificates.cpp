@@ -2,6 +2,7 @@
 
 #include "foundation/CXException.h"
 #include "foundation/Paths.h"
+#include "foundation/Release.h"
 
 #include <algorithm>
 #include <arpa/inet.h>
@@ -18,13 +19,6 @@ namespace rolvane {
 
 namespace {
 
-template <auto Free>
-struct Release {
-    template <class T>
-    void operator()(T* p) const {
-        Free(p);
-    }
-};
 using Key = std::unique_ptr<EVP_PKEY, Release<EVP_PKEY_free>>;
 using Certificate = std::unique_ptr<X509, Release<X509_free>>;
 using Memory = std::unique_ptr<BIO, Release<BIO_free_all>>;

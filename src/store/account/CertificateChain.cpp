@@ -1,6 +1,7 @@
 #include "store/account/CertificateChain.h"
 
 #include "foundation/CXException.h"
+#include "foundation/Release.h"
 
 #include <algorithm>
 #include <cstring>
@@ -18,13 +19,6 @@ namespace {
 
 constexpr size_t kMost = 32; // certificates of one chain
 
-template <auto Free>
-struct Release {
-    template <class T>
-    void operator()(T* object) const {
-        Free(object);
-    }
-};
 using Certificate = std::unique_ptr<X509, Release<X509_free>>;
 using Memory = std::unique_ptr<BIO, Release<BIO_free_all>>;
 

@@ -4,6 +4,7 @@
 #include "foundation/Log.h"
 #include "foundation/Paths.h"
 #include "store/dav/CXDAVManagerImpl.h"
+#include "store/dav/CXDAVNode.h"
 #include "store/dav/Collections.h"
 #include "store/locks/LockAnswers.h"
 
@@ -15,19 +16,6 @@
 namespace rolvane {
 
 namespace {
-
-std::string escaped(const std::string& text) {
-    std::string out;
-    for (const char c : text) {
-        if (c == '&')
-            out += "&amp;";
-        else if (c == '<')
-            out += "&lt;";
-        else
-            out += c;
-    }
-    return out;
-}
 
 // The last word is the run's mark, see LockLedger.
 std::string ownerOf(const UserName& user, const std::string& request, const std::string& run) {
@@ -153,7 +141,8 @@ HttpResponse StoreLock::ask(const LockToken& refreshed, const std::string& mark)
         r.body = std::make_shared<const std::string>(
             "<?xml version=\"1.0\" encoding=\"utf-8\"?>\n<lockinfo xmlns=\"DAV:\"><lockscope><exclusive/></lockscope>"
             "<locktype><write/></locktype><owner>" +
-            escaped(ownerOf(client->session.account().user, mark, _ledger.markOfThisRun())) + "</owner></lockinfo>");
+            CXDAVNode::escaped(ownerOf(client->session.account().user, mark, _ledger.markOfThisRun())) +
+            "</owner></lockinfo>");
     }
     return client->session.sendUnnoted(std::move(r));
 }

@@ -2,6 +2,7 @@
 
 #include "store/dav/CXDAVManager.h"
 #include "store/dav/CXDAVManagerImpl.h"
+#include "store/dav/CXDAVNode.h"
 #include "store/http/HttpTransport.h"
 
 #include <limits>
@@ -12,24 +13,11 @@ namespace {
 
 constexpr size_t kMostTrees = 1000; // that a store takes
 
-std::string escaped(const std::string& text) {
-    std::string out;
-    for (const char c : text) {
-        if (c == '&')
-            out += "&amp;";
-        else if (c == '<')
-            out += "&lt;";
-        else
-            out += c;
-    }
-    return out;
-}
-
 std::shared_ptr<const std::string> bodyFor(const std::vector<Url>& places, const std::string& position) {
     std::string text = "<?xml version=\"1.0\" encoding=\"utf-8\"?>\n<R:news xmlns:R=\"http://rolvane.net/ns/\" "
                        "xmlns:D=\"DAV:\">";
-    for (const Url& place : places) text += "<D:href>" + escaped(place.encodedPath()) + "</D:href>";
-    if (!position.empty()) text += "<R:since>" + escaped(position) + "</R:since>";
+    for (const Url& place : places) text += "<D:href>" + CXDAVNode::escaped(place.encodedPath()) + "</D:href>";
+    if (!position.empty()) text += "<R:since>" + CXDAVNode::escaped(position) + "</R:since>";
     return std::make_shared<const std::string>(text + "</R:news>");
 }
 
