@@ -8,6 +8,7 @@
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
 #include "foundation/Preferences.h"
+#include "foundation/TestSwitch.h"
 #include "model/PayloadKeys.h"
 #include "model/RemoteLocationMap.h"
 #include "store/account/CXNetworkController.h"
@@ -166,6 +167,7 @@ void CXDVaultraConduit::close() {
     CXDLog("Closing, last sync: %@", now);
     // A store that went away during the pass tells no date: keeping the old one costs reads, a guessed one loses edits.
     if (!now) return;
+    if (isLeftOut("date of the store")) now = _world.clock.now();
     _lastSyncDate = now;
     _world.preferences.set(kDaemonDomain, kLastSyncDateKey, *now);
     _world.preferences.synchronize(kDaemonDomain);

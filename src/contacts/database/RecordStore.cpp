@@ -7,6 +7,7 @@
 #include "contacts/database/DamagedDatabase.h"
 #include "foundation/Paths.h"
 #include "foundation/PropertyList.h"
+#include "foundation/TestSwitch.h"
 
 #include <algorithm>
 #include <atomic>
@@ -142,6 +143,7 @@ const std::string& RecordStore::makeIfMissing(const std::string& path, int busyT
 RecordStore::RecordStore(Sqlite& database) : _database(database) {
     makeOrCheckFormat();
     _database.execute("PRAGMA synchronous=FULL; PRAGMA foreign_keys=ON; PRAGMA cache_size=-8000;");
+    if (isLeftOut("sync")) _database.execute("PRAGMA synchronous=OFF");
 }
 
 void RecordStore::makeOrCheckFormat() {

@@ -2,6 +2,8 @@
 
 #include "contacts/database/RolvaneImpl.h"
 
+#include "foundation/TestSwitch.h"
+
 #include <algorithm>
 #include <unistd.h>
 
@@ -197,6 +199,7 @@ void CXRolvane::advanceCursorTo(int64_t position, Date scannedSince) {
 }
 
 void CXRolvane::Impl::advanceCursor(const Scanned& scan) {
+    if (isLeftOut("cursor")) return;
     const int64_t from = cursor();
     const std::optional<int64_t> missed =
         journal.firstForeignNotAfter(from, scan.position, options.program, scan.since);

@@ -5,6 +5,7 @@
 #include "foundation/KeyedArchive.h"
 #include "foundation/Log.h"
 #include "foundation/Paths.h"
+#include "foundation/TestSwitch.h"
 #include "model/PayloadKeys.h"
 #include "model/RemoteLocationMap.h"
 
@@ -111,6 +112,7 @@ void EngineState::forgetPut() noexcept {
 }
 
 void EngineState::put(const StateRows& rows) {
+    if (isLeftOut("states")) return;
     bool isAnother = false, isOther = false;
     const auto changes = [&](const std::string& row) {
         isAnother = true;
@@ -166,6 +168,7 @@ CXDChangeRecords EngineState::getPendingChanges() const {
 }
 
 void EngineState::setPendingChanges(const CXDChangeRecords& records) {
+    if (isLeftOut("queue")) return;
     const auto archived = [&](size_t i) {
         DictionaryCoder coder;
         records[i]->encodeWithCoder(coder);
@@ -176,7 +179,7 @@ void EngineState::setPendingChanges(const CXDChangeRecords& records) {
 }
 
 Dictionary EngineState::underWay() const {
-    return _preferences.get(kDaemonDomain, kCXDUnderWay).dictionary();
+    return isLeftOut("under way") ? Dictionary() : _preferences.get(kDaemonDomain, kCXDUnderWay).dictionary();
 }
 
 void EngineState::setUnderWay(const Dictionary& underWay) {
@@ -285,6 +288,7 @@ void EngineState::forgetUser(const UserName& user) {
 }
 
 void EngineState::claim(int64_t shareCount, const std::optional<UserName>& user) {
+    if (isLeftOut("claim")) return;
     if (!_preferences.get(kDaemonDomain, kCXDShareCount)) _preferences.set(kDaemonDomain, kCXDShareCount, shareCount);
     if (user && !_preferences.get(kDaemonDomain, kCXDLastOstrelUser))
         _preferences.set(kDaemonDomain, kCXDLastOstrelUser, *user);

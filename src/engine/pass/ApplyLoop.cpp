@@ -17,6 +17,7 @@
 #include "engine/recovery/UnsettledGroups.h"
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "foundation/TestSwitch.h"
 #include "model/PayloadKeys.h"
 #include "model/RemoteLocationMap.h"
 #include "store/files/CXFileManager.h"
@@ -118,9 +119,9 @@ void ApplyLoop::run(CXDChangeRecords records, bool trickle, bool allowRetry) {
     } catch (const CXException& e) {
         CXLog("applyChangeRecords close: Caught %@: %@", e.name(), e.reason());
         _parts.outcomes.couldNotStore(e.reason());
-        _parts.with.rolvane.rollback();
+        if (!isLeftOut("rollback")) _parts.with.rolvane.rollback();
         _parts.state.dropConduitData();
-        _parts.conduits.vaultra->passWasNotStored();
+        if (!isLeftOut("rollback of versions")) _parts.conduits.vaultra->passWasNotStored();
         if (trickle) notStored = std::current_exception();
     }
     _parts.marksOfThePass = {};
@@ -219,7 +220,8 @@ void ApplyLoop::queue() {
     LostInFolds lost;
     CXDChangeRecords flat = flattenGroupChanges(accepted, &lost);
     for (const auto& groups : {lost.lists, lost.contents})
-        for (const UniqueId& group : groups) _unsettled.set(group.str(), true);
+        for (const UniqueId& group : groups)
+            if (!isLeftOut("lost in folds")) _unsettled.set(group.str(), true);
     for (const UniqueId& group : lost.contents) noteUnsure(group);
     sortByType(flat);
     _totalCount = flat.size();
@@ -240,7 +242,7 @@ void ApplyLoop::split() {
     _gatheringChanged = _parts.with.rolvane.hasUnsavedChanges();
     _parts.conduits.vaultra->willWrite(outOfOrder);
     _outOfOrder = std::make_unique<OutOfOrderWork>(_parts, std::move(outOfOrder));
-    if (!now.empty()) noteUnderWay();
+    if (!now.empty() && !isLeftOut("note before the workers")) noteUnderWay();
 }
 
 // What cannot be noted is not done: a later pass would find it on the store, take it for somebody else's, and bring it
@@ -367,6 +369,7 @@ void ApplyLoop::saveInThePass() {
 // The database has everybody in its list of all as soon as they are there. The change that says so comes later in the
 // pass: were it killed in between, the next one would take them for the user's own.
 void ApplyLoop::listArrived() {
+    if (isLeftOut("listing of what arrived")) return;
     if (!_listings) {
         _listings.emplace();
         for (size_t i = _inOrderDone; i < _inOrder.size(); ++i) {
@@ -464,6 +467,7 @@ void ApplyLoop::tryAgainAtTheEnd(int32_t source, const CXDChangeRecordPtr& recor
 // database does. The next scan compares the two and gives the store the owner's. False of anything else: nobody knows
 // whether the database ever had what it does not have, so that stays on the store.
 bool ApplyLoop::noteSwallowed(const CXDChangeRecord& record) {
+    if (isLeftOut("swallowed")) return false;
     switch (record.type()) {
     case CXDAddRecordToGroup:
     case CXDAddGroupToGroup:

@@ -12,6 +12,7 @@
 #include "engine/recovery/UnderWay.h"
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "foundation/TestSwitch.h"
 #include "model/PayloadKeys.h"
 #include "model/RemoteLocationMap.h"
 
@@ -135,6 +136,7 @@ void ApplyLoop::tellRefused() {
 // What another user's store has refused is undone in the copy: contacts are read again, and a group counts as changed
 // there, so that the next comparison finds the store without the change.
 void ApplyLoop::takeBack(const CXDChangeRecord& record) {
+    if (isLeftOut("taking back")) return;
     if (record.initialSource() != CXDSyncSourceCX || record.changeMadeByDataOwner() || !record.user()) return;
     _parts.conduits.vaultra->wasRefused(record);
     if (!record.group()) return;
@@ -147,12 +149,13 @@ void ApplyLoop::takeBack(const CXDChangeRecord& record) {
 }
 
 void ApplyLoop::noteUnsure(const UniqueId& group) {
+    if (isLeftOut("unsure groups")) return;
     _end.unsureGroups.insert(cxUIDWithTableName(group, kCXGroupTable));
 }
 
 // The next scan takes them from there. False when there are none.
 bool ApplyLoop::noteUnsettled() {
-    if (_unsettled.empty()) return false;
+    if (_unsettled.empty() || isLeftOut("unsettled groups")) return false;
     _parts.state.conduitObjectForKey(kConduitCX, kUnsettledGroups).addEntriesFrom(_unsettled);
     return true;
 }
@@ -166,7 +169,9 @@ void ApplyLoop::bumpShareCount() {
     rolvane.save();
     const std::optional<UserName> user = _parts.with.account.vaultraUser();
     preferences.set(kDaemonDomain, kCXDLastOstrelUser, user ? Value(*user) : Value());
-    if (_underWay) _parts.state.setUnderWay(adrift(*_underWay, _parts.state.conduitData(), _end));
+    if (_underWay)
+        _parts.state.setUnderWay(isLeftOut("adrift") ? Dictionary()
+                                                     : adrift(*_underWay, _parts.state.conduitData(), _end));
     _parts.state.putConduitData();
     if (preferences.get(kDaemonDomain, kCXDKnownDatabase) != Value(rolvane.databaseIdentity()))
         preferences.set(kDaemonDomain, kCXDKnownDatabase, rolvane.databaseIdentity());

@@ -3,6 +3,7 @@
 #include "contacts/records/Identifier.h"
 #include "engine/queue/ChangeQueue.h"
 #include "foundation/Log.h"
+#include "foundation/TestSwitch.h"
 #include "model/PayloadKeys.h"
 
 #include <algorithm>
@@ -57,7 +58,7 @@ bool TakenOut::concerns(const CXDChangeRecord& record) const {
 }
 
 std::vector<GroupThatIsGone> TakenOut::drop(CXDChangeRecords& records) const {
-    if (_sources.empty()) return {};
+    if (_sources.empty() || isLeftOut("deletions win")) return {};
     std::set<GroupThatIsGone> changedHere;
     std::erase_if(records, [&](const CXDChangeRecordPtr& record) {
         const bool isFromHere = record->initialSource() == CXDSyncSourceCX;

@@ -2,6 +2,7 @@
 
 #include "contacts/records/CXGroup.h"
 #include "engine/recovery/Holdings.h"
+#include "foundation/TestSwitch.h"
 #include "model/PayloadKeys.h"
 
 #include <algorithm>
@@ -50,6 +51,7 @@ void withdrawMembers(const CXDChangeRecord& composite, Holdings& holdings, CXDCh
 
 void withdrawWhatIsGone(CXDChangeRecords& records, size_t fresh, CXRolvane& rolvane,
                         const std::function<bool(const UserName& user)>& hasCopies) {
+    if (isLeftOut("what is gone")) return;
     Holdings holdings(rolvane);
     CXDChangeRecords removals;
     for (size_t i = fresh; i < records.size(); ++i) {
@@ -66,6 +68,7 @@ void withdrawWhatIsGone(CXDChangeRecords& records, size_t fresh, CXRolvane& rolv
 }
 
 void dropRemovalsOfWhatIsBack(CXDChangeRecords& records, size_t fresh, CXRolvane& rolvane) {
+    if (isLeftOut("what is back")) return;
     const auto found = [&](const UniqueId& uid, std::string_view table) {
         return rolvane.recordForUniqueId(cxUIDWithTableName(uid, table));
     };

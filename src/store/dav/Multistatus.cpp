@@ -1,5 +1,6 @@
 #include "store/dav/Multistatus.h"
 
+#include "foundation/TestSwitch.h"
 #include "store/dav/XmlSax.h"
 
 #include <algorithm>
@@ -135,7 +136,8 @@ bool MultistatusReader::feed(std::string_view bytes) {
 }
 
 std::optional<std::vector<MultistatusEntry>> MultistatusReader::finish() {
-    if (!_impl->finish() || !_impl->rootSeen) return std::nullopt;
+    const bool isWhole = _impl->finish() || isLeftOut("end of listing");
+    if (!isWhole || !_impl->rootSeen) return std::nullopt;
     return std::move(_impl->entries);
 }
 
