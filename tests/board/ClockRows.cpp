@@ -18,20 +18,26 @@ constexpr std::array kTurns{Turn{"an hour ahead", kHour},       Turn{"an hour be
 } // namespace
 
 // The machine's clock is wrong for one pass, and right again for the next.
+bool turnClockOnce(Work& work, size_t number) {
+    if (number >= scenarios().size() * kTurns.size()) return false;
+    const Scenario& scenario = scenarios()[number / kTurns.size()];
+    const Turn& turn = kTurns[number % kTurns.size()];
+    work.stage.forgetStory();
+    work.stage.bringBack(scenario.name);
+    Fault fault;
+    fault.clock = turn.seconds;
+    const Ending ending = work.stage.pass(scenario.role, fault);
+    goOn(work, scenario, number);
+    judge(work, scenario.name + ", the clock is " + turn.name, settlingOf(scenario), ending);
+    return true;
+}
+
 void turnClock(Work& work) {
-    size_t number = 0;
-    for (const Scenario& scenario : scenarios())
-        for (const Turn& turn : kTurns) {
-            if (!work.isMine(number++)) continue;
-            if (work.timeIsOver()) return;
-            work.stage.forgetStory();
-            work.stage.bringBack(scenario.name);
-            Fault fault;
-            fault.clock = turn.seconds;
-            const Ending ending = work.stage.pass(scenario.role, fault);
-            goOn(work, scenario, number);
-            judge(work, scenario.name + ", the clock is " + turn.name, settlingOf(scenario), ending);
-        }
+    for (size_t number = 0; number < scenarios().size() * kTurns.size(); ++number) {
+        if (!work.isMine(number)) continue;
+        if (work.timeIsOver()) return;
+        turnClockOnce(work, number);
+    }
 }
 
 } // namespace rolvane::board

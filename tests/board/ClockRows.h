@@ -4,6 +4,8 @@
 
 namespace rolvane::board {
 
+// One case; false when there are fewer.
+bool turnClockOnce(Work& work, size_t number);
 void turnClock(Work& work);
 
 } // namespace rolvane::board

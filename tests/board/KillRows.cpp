@@ -16,18 +16,23 @@ Fault killAt(int64_t operation) {
 
 } // namespace
 
+bool killOnce(Work& work, const Scenario& scenario, size_t operation) {
+    work.stage.forgetStory();
+    work.stage.bringBack(scenario.name);
+    const Ending ending = work.stage.pass(scenario.role, killAt(static_cast<int64_t>(operation)));
+    if (ending.met == 0) return false;
+    goOn(work, scenario, operation);
+    judge(work, scenario.name + " killed at " + std::to_string(operation), settlingOf(scenario), ending);
+    return true;
+}
+
 // A pass of each scenario is ended before each operation, and after each answer.
 void killEverywhere(Work& work) {
     for (const Scenario& scenario : scenarios())
         for (size_t operation = 0; operation < kMostOperations; ++operation) {
             if (!work.isMine(operation)) continue;
             if (work.timeIsOver()) return;
-            work.stage.forgetStory();
-            work.stage.bringBack(scenario.name);
-            const Ending ending = work.stage.pass(scenario.role, killAt(static_cast<int64_t>(operation)));
-            if (ending.met == 0) break; // the pass has fewer
-            goOn(work, scenario, operation);
-            judge(work, scenario.name + " killed at " + std::to_string(operation), settlingOf(scenario), ending);
+            if (!killOnce(work, scenario, operation)) break;
         }
 }
 

@@ -8,8 +8,15 @@ namespace {
 
 constexpr size_t kStates = 1000, kCommands = 10; // each so many-th is a command that has ended well
 
+worlds::Chance chanceOf(const Work& work, size_t number) {
+    return worlds::Chance(worlds::hashOf("power", work.stage.seed() * 10000 + number));
+}
+
+} // namespace
+
 // The pass ends at some operation, and of what it wrote to files only what a disk keeps is there.
-void losePowerInAPass(Work& work, const Scenario& scenario, size_t number, worlds::Chance& chance) {
+void losePowerOnce(Work& work, const Scenario& scenario, size_t number) {
+    worlds::Chance chance = chanceOf(work, number);
     Stage& stage = work.stage;
     stage.bringBack(scenario.name);
     const int64_t whole = stage.pass(scenario.role, {.kind = FaultControl::kill, .at = INT32_MAX}).operations;
@@ -36,7 +43,8 @@ void losePowerInAPass(Work& work, const Scenario& scenario, size_t number, world
 }
 
 // What a command has said to be done is there after a power loss.
-void losePowerBehindACommand(Work& work, size_t number, worlds::Chance& chance) {
+void losePowerBehindACommand(Work& work, size_t number) {
+    worlds::Chance chance = chanceOf(work, number);
     Stage& stage = work.stage;
     stage.forgetStory();
     stage.bringBack("in-step");
@@ -57,17 +65,14 @@ void losePowerBehindACommand(Work& work, size_t number, worlds::Chance& chance) 
     work.failed("power lost behind a command, state " + std::to_string(number), {"what it added is gone"});
 }
 
-} // namespace
-
 void losePower(Work& work) {
     for (size_t number = 0; number < kStates; ++number) {
         if (!work.isMine(number)) continue;
         if (work.timeIsOver()) return;
-        worlds::Chance chance(worlds::hashOf("power", work.stage.seed() * 10000 + number));
         if (number / work.every % kCommands == 0)
-            losePowerBehindACommand(work, number, chance);
+            losePowerBehindACommand(work, number);
         else
-            losePowerInAPass(work, chance.oneOf(scenarios()), number, chance);
+            losePowerOnce(work, scenarios()[number % scenarios().size()], number);
     }
 }
 

@@ -77,8 +77,9 @@ bool changes(const std::string& request) {
            !request.starts_with("HEAD") && !request.starts_with("REPORT");
 }
 
-// False when the pass has fewer requests.
-bool spoil(Work& work, const Scenario& scenario, size_t request, const std::string& kind) {
+} // namespace
+
+bool spoilRequest(Work& work, const Scenario& scenario, size_t request, const std::string& kind) {
     Stage& stage = work.stage;
     stage.forgetStory();
     stage.bringBack(scenario.name);
@@ -102,8 +103,6 @@ bool spoil(Work& work, const Scenario& scenario, size_t request, const std::stri
     return true;
 }
 
-} // namespace
-
 void spoilRequests(Work& work) {
     for (const Scenario& scenario : scenarios())
         for (size_t kind = 0; kind < kKinds.size(); ++kind)
@@ -111,7 +110,7 @@ void spoilRequests(Work& work) {
                 if (!work.isMine(request + kind)) continue;
                 if (kind + 1 == kKinds.size() && request / work.every % kHangs != 0) continue;
                 if (work.timeIsOver()) return;
-                if (!spoil(work, scenario, request, kKinds[kind])) break;
+                if (!spoilRequest(work, scenario, request, kKinds[kind])) break;
             }
 }
 

@@ -3,7 +3,6 @@
 #include "../worlds/Report.h"
 #include "../worlds/StoreView.h"
 #include "foundation/CXException.h"
-#include "support/ChildProcess.h"
 #include "support/UserWorld.h"
 
 #include <csignal>
@@ -108,6 +107,7 @@ std::vector<std::string> Stage::environmentOf(char role) const {
                                  "LD_PRELOAD=" + _shim, std::string(kControlVariable) + "=" + _directory / "control"};
     for (const auto& [variable, directory] : kDirectories)
         all.push_back(std::string(variable) + "=" + home(role) + "/" + directory);
+    if (!_leftOut.empty()) all.push_back("ROLVANE_LEFT_OUT=" + _leftOut);
     if (const char* temporary = std::getenv("TMPDIR")) all.push_back(std::string("TMPDIR=") + temporary);
     return all;
 }
@@ -150,11 +150,18 @@ Ending Stage::run(char role, std::vector<std::string> arguments, const Fault& fa
 }
 
 Ending Stage::pass(char role, const Fault& fault) {
-    return run(role, {test::UserWorld::managerProgram(), "-p"}, fault, {});
+    return run(role, {_leftOut.empty() ? test::UserWorld::managerProgram() : ROLVANE_SWITCHED_MANAGER, "-p"}, fault,
+               {});
+}
+
+std::unique_ptr<test::ChildProcess> Stage::startDaemon(char role) {
+    return std::make_unique<test::ChildProcess>(test::ChildProcess::Options{
+        .arguments = {test::UserWorld::managerProgram()}, .environment = environmentOf(role)});
 }
 
 Ending Stage::command(char role, std::vector<std::string> arguments, const Fault& fault, const std::string& input) {
-    arguments.insert(arguments.begin(), test::UserWorld::rolvaneProgram());
+    arguments.insert(arguments.begin(),
+                     _leftOut.empty() ? test::UserWorld::rolvaneProgram() : ROLVANE_SWITCHED_ROLVANE);
     return run(role, std::move(arguments), fault, input);
 }
 

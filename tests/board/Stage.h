@@ -9,6 +9,7 @@
 #include "foundation/Url.h"
 #include "server/PrivateStore.h"
 #include "store/http/HttpTransport.h"
+#include "support/ChildProcess.h"
 #include "support/TempHome.h"
 
 #include <functional>
@@ -49,7 +50,12 @@ public:
     Stage(const Stage&) = delete;
     Stage& operator=(const Stage&) = delete;
 
-    Ending pass(char role, const Fault& fault = {}); // a daemon that makes one pass and ends
+    // The programs from now on do without that part of themselves (foundation/TestSwitch.h); "" and they are those that
+    // are installed.
+    void leaveOut(const std::string& part) { _leftOut = part; }
+
+    Ending pass(char role, const Fault& fault = {});            // a daemon that makes one pass and ends
+    std::unique_ptr<test::ChildProcess> startDaemon(char role); // one that stays, and meets no fault
     Ending command(char role, std::vector<std::string> arguments, const Fault& fault = {},
                    const std::string& input = {});
     void edit(char role, const worlds::Habits& habits, const std::string& stamp);
@@ -102,7 +108,8 @@ private:
     std::map<std::string, worlds::Model> _keptModels;
     std::string _story;
     std::string _password = "open sesame";
-    size_t _logRead = 0; // bytes of the store's log
+    std::string _leftOut; // a part of the programs
+    size_t _logRead = 0;  // bytes of the store's log
 };
 
 } // namespace rolvane::board

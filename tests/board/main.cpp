@@ -2,10 +2,14 @@
 
 #include "Board.h"
 #include "ClockRows.h"
+#include "DamageRows.h"
 #include "DiskRows.h"
 #include "KillRows.h"
+#include "MeetingRows.h"
 #include "PowerRows.h"
 #include "RequestRows.h"
+#include "ResidentRows.h"
+#include "SeededBugs.h"
 #include "Table.h"
 #include "foundation/CXException.h"
 
@@ -35,6 +39,15 @@ const std::vector<Row>& rows() {
          "each request of a pass answered by 500, 503, 429, 401, 403, 404, 409, 412, 423, 507, a portal or half a "
          "document, cut, reset, not at all, or lost behind its deed",
          spoilRequests, true},
+        {"calm", "none: each pass as it is", calm},
+        {"meet",
+         "a contact is written by somebody else, who asks for no lock, between a pass's reading and its writing", meet,
+         true},
+        {"damage", "the database, its log, the account or another file of a home damaged at a place of chance", damage},
+        {"stay", "daemons that stay make 1,000 passes with 10,000 changes, and a tenth of the requests fails",
+         stayAndWork, true},
+        {"bugs", "the programs go wrong on purpose: one part after the other is left out; a failure is one not noticed",
+         findSeededBugs, true},
     };
     return all;
 }
@@ -163,6 +176,7 @@ void work(const Arguments& arguments, Count* counts, size_t job) {
             Count& count = counts[i];
             const auto share = Clock::now() + (end - Clock::now()) / static_cast<int64_t>(left);
             Work todo{*stage, count, job, arguments.jobs, arguments.every, arguments.goesOn, nullptr, nullptr};
+            todo.told = [](const std::string& line) { print(line + "\n"); };
             todo.timeIsOver = [&] {
                 const bool over = arguments.seconds > 0 && count.cases > 0 && Clock::now() > share;
                 if (over) count.cut = true;
