@@ -80,6 +80,7 @@ std::string renderStoreConfiguration(const std::string& templateText, const Priv
                      // A sixteenth of all connections of the process, so that there is room for others.
                      {"NEWCOMERS", std::to_string(4 * threads)},
                      {"UPLOADS", std::to_string(std::max(threads / 2, 1))}, // others have the other threads
+                     {"SLOW_THREADS", std::to_string(std::max(3 * threads / 4, 1))},
                      {"SPARE_THREADS", std::to_string(std::max(threads / 2, 1))},
                      {"WORKERS", std::to_string(threads * limit)},
                      {"KEEPALIVE_TIMEOUT", std::to_string(std::max(options.keepAliveSeconds, 1))},

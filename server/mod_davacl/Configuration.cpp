@@ -128,22 +128,26 @@ const char* setSlows(cmd_parms* cmd, void*, int on) {
     return nullptr;
 }
 
+// 0, or a number up to 100,000.
+bool readBound(const char* text, int& into) {
+    if (std::strcmp(text, "0") != 0) return readNumber(text, 100000, into);
+    into = 0;
+    return true;
+}
+
 const char* setNewcomers(cmd_parms* cmd, void*, const char* text) {
-    int& into = ofServer(cmd->server)->newcomers;
-    if (std::strcmp(text, "0") == 0) {
-        into = 0;
-        return nullptr;
-    }
-    return readNumber(text, 100000, into) ? nullptr : "the number of connections must be from 0 to 100000";
+    return readBound(text, ofServer(cmd->server)->newcomers) ? nullptr
+                                                             : "the number of connections must be from 0 to 100000";
 }
 
 const char* setUploads(cmd_parms* cmd, void*, const char* text) {
-    int& into = ofServer(cmd->server)->uploads;
-    if (std::strcmp(text, "0") == 0) {
-        into = 0;
-        return nullptr;
-    }
-    return readNumber(text, 100000, into) ? nullptr : "the number of requests must be from 0 to 100000";
+    return readBound(text, ofServer(cmd->server)->uploads) ? nullptr
+                                                           : "the number of requests must be from 0 to 100000";
+}
+
+const char* setSlowThreads(cmd_parms* cmd, void*, const char* text) {
+    return readBound(text, ofServer(cmd->server)->slowThreads) ? nullptr
+                                                               : "the number of threads must be from 0 to 100000";
 }
 
 const char* setNews(cmd_parms* cmd, void*, int on) {
@@ -230,6 +234,11 @@ size_t uploadsOfUser(const server_rec* server) {
     return c && c->uploads > 0 ? static_cast<size_t>(c->uploads) : 0;
 }
 
+size_t mostSlowThreads(const server_rec* server) {
+    const Configuration* c = ofServer(server);
+    return c && c->slowThreads > 0 ? static_cast<size_t>(c->slowThreads) : 0;
+}
+
 bool givesNews(const server_rec* server) {
     const Configuration* c = ofServer(server);
     return c && c->base && c->news > 0;
@@ -273,6 +282,7 @@ void* mergeConfigurations(apr_pool_t* pool, void* base, void* more) {
     if (inner->parks >= 0) merged->parks = inner->parks;
     if (inner->newcomers >= 0) merged->newcomers = inner->newcomers;
     if (inner->uploads >= 0) merged->uploads = inner->uploads;
+    if (inner->slowThreads >= 0) merged->slowThreads = inner->slowThreads;
     if (inner->news >= 0) merged->news = inner->news;
     if (inner->newsOfUser) merged->newsOfUser = inner->newsOfUser;
     if (inner->heartbeat) merged->heartbeat = inner->heartbeat;
@@ -368,6 +378,8 @@ const command_rec kDirectives[] = {
      "a directory for the passwords that users choose themselves; without it they cannot"},
     {"DavAclUploadsOfUser", asCommand(setUploads), nullptr, RSRC_CONF, TAKE1,
      "how many requests of one user may wait for bytes of their bodies in each process"},
+    {"DavAclSlowThreads", asCommand(setSlowThreads), nullptr, RSRC_CONF, TAKE1,
+     "how many threads of each process may wait for a second for clients' networks: 0, no bound, by default"},
     {"DavAclNewcomers", asCommand(setNewcomers), nullptr, RSRC_CONF, TAKE1,
      "how many connections of one address, in one process, may be silent without a sign-in: 0, no bound, by default"},
     {"DavAclNews", asCommand(setNews), nullptr, RSRC_CONF, FLAG,

@@ -20,6 +20,7 @@ struct Configuration {
     int slows = -1;                      // whether guesses of passwords are slowed down; -1: not said
     int newcomers = -1;                  // -1: not said
     int uploads = -1;                    // -1: not said
+    int slowThreads = -1;                // -1: not said
     int news = -1;                       // whether readers may wait for news; -1: not said
     int newsOfUser = 0;                  // the most waiting requests of one user in a process; 0: not said
     int heartbeat = 0;                   // seconds between two lines; 0: not said
@@ -42,11 +43,12 @@ const char* lastUseDirectoryOf(const request_rec* r);
 const char* ownPasswordsOf(const request_rec* r); // DavAclOwnPasswords' argument; null when there is none
 // DavAclParkConnections, of the host that the connection came to.
 bool parksConnections(const server_rec* server);
-int mostNewcomers(const server_rec* server);    // 0: no bound
-size_t uploadsOfUser(const server_rec* server); // DavAclUploadsOfUser; 0: no bound
-bool givesNews(const server_rec* server);       // DavAclNews, where there is a base
-size_t newsOfUser(const Configuration& c);      // DavAclNewsOfUser
-int newsHeartbeat(const Configuration& c);      // seconds; DavAclNewsHeartbeat
+int mostNewcomers(const server_rec* server);      // 0: no bound
+size_t uploadsOfUser(const server_rec* server);   // DavAclUploadsOfUser; 0: no bound
+size_t mostSlowThreads(const server_rec* server); // DavAclSlowThreads; 0: no bound
+bool givesNews(const server_rec* server);         // DavAclNews, where there is a base
+size_t newsOfUser(const Configuration& c);        // DavAclNewsOfUser
+int newsHeartbeat(const Configuration& c);        // seconds; DavAclNewsHeartbeat
 
 void* createConfiguration(apr_pool_t* pool, server_rec* server);
 void* mergeConfigurations(apr_pool_t* pool, void* base, void* more);

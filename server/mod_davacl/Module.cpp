@@ -6,6 +6,7 @@
 #include "server/mod_davacl/Confinement.h"
 #include "server/mod_davacl/Enforcement.h"
 #include "server/mod_davacl/LiveProperties.h"
+#include "server/mod_davacl/NetworkWaits.h"
 #include "server/mod_davacl/Newcomers.h"
 #include "server/mod_davacl/Parking.h"
 #include "server/mod_davacl/Passwords.h"
@@ -43,6 +44,12 @@ void registerHooks(apr_pool_t* pool) noexcept {
     ap_hook_fixups(noteSignIn, nullptr, nullptr, APR_HOOK_REALLY_FIRST - 1);
     ap_hook_log_transaction(noteAnswer, nullptr, nullptr, APR_HOOK_REALLY_FIRST);
     ap_hook_process_connection(parkSilent, nullptr, nullptr, APR_HOOK_REALLY_FIRST);
+    registerNetworkWaits();
+    ap_hook_child_init(watchSlowThreads, nullptr, nullptr, APR_HOOK_MIDDLE);
+    ap_hook_pre_connection(watchConnection, nullptr, nullptr, APR_HOOK_MIDDLE);
+    ap_hook_pre_close_connection(endWatching, nullptr, nullptr, APR_HOOK_REALLY_FIRST);
+    ap_hook_post_read_request(beginRequest, nullptr, nullptr, APR_HOOK_REALLY_FIRST);
+    ap_hook_fixups(boundSlowThreads, nullptr, nullptr, APR_HOOK_REALLY_FIRST - 1);
     registerUploads();
     ap_hook_insert_filter(boundUpload, nullptr, nullptr, APR_HOOK_LAST);
     ap_hook_insert_error_filter(leaveRefusedBody, nullptr, nullptr, APR_HOOK_MIDDLE);

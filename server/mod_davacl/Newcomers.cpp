@@ -1,18 +1,16 @@
 #include "server/mod_davacl/Newcomers.h"
 
 #include "server/mod_davacl/Configuration.h"
+#include "server/mod_davacl/EachSecond.h"
 #include "server/mod_davacl/NewcomerBound.h"
 
 #include <apr_portable.h>
 #include <chrono>
-#include <condition_variable>
-#include <csignal>
 #include <fcntl.h>
 #include <mutex>
 #include <netinet/in.h>
 #include <string>
 #include <sys/socket.h>
-#include <thread>
 #include <unistd.h>
 #include <unordered_map>
 
@@ -20,7 +18,6 @@ namespace rolvane::davacl {
 namespace {
 
 using Clock = std::chrono::steady_clock;
-constexpr auto kPace = std::chrono::seconds(1);
 
 std::string addressOf(const conn_rec* c) {
     const apr_sockaddr_t* address = c->client_addr;
@@ -127,40 +124,8 @@ const conn_rec* connectionOf(const request_rec* r) {
     return r->connection->master ? r->connection->master : r->connection;
 }
 
-class Watch {
-public:
-    explicit Watch(const server_rec* server) : _server(server) {
-        sigset_t all, before;
-        sigfillset(&all);
-        pthread_sigmask(SIG_SETMASK, &all, &before); // signals are the other threads'
-        _thread = std::thread([this] { serve(); });
-        pthread_sigmask(SIG_SETMASK, &before, nullptr);
-    }
-    ~Watch() {
-        {
-            const std::lock_guard lock(_mutex);
-            _ended = true;
-        }
-        _end.notify_all();
-        _thread.join();
-    }
-    Watch(const Watch&) = delete;
-    Watch& operator=(const Watch&) = delete;
-
-private:
-    void serve() {
-        std::unique_lock lock(_mutex);
-        while (!_end.wait_for(lock, kPace, [this] { return _ended; })) newcomers().closeSurplus(_server);
-    }
-    const server_rec* const _server;
-    std::mutex _mutex;
-    std::condition_variable _end;
-    bool _ended = false; // guarded by _mutex
-    std::thread _thread;
-};
-
 apr_status_t endWatch(void* watch) {
-    delete static_cast<Watch*>(watch);
+    delete static_cast<EachSecond*>(watch);
     return APR_SUCCESS;
 }
 
@@ -200,7 +165,8 @@ void watchNewcomers(apr_pool_t* pool, server_rec* server) noexcept {
     for (const server_rec* each = server; each; each = each->next) wanted = wanted || mostNewcomers(each) > 0;
     if (!wanted) return;
     try {
-        apr_pool_cleanup_register(pool, new Watch(server), endWatch, apr_pool_cleanup_null);
+        apr_pool_cleanup_register(pool, new EachSecond([server] { newcomers().closeSurplus(server); }), endWatch,
+                                  apr_pool_cleanup_null);
     } catch (const std::exception& e) {
         ap_log_error(APLOG_MARK, APLOG_ERR, 0, server, "davacl: newcomers are not watched: %s", e.what());
     }

@@ -1,4 +1,5 @@
 #include "StoreTestWorld.h"
+#include "TLSConnection.h"
 
 #include <arpa/inet.h>
 #include <chrono>
@@ -86,51 +87,6 @@ private:
     int _port;
     std::vector<int> _sockets;
     std::vector<SSL*> _sessions;
-};
-
-class TLSConnection {
-public:
-    explicit TLSConnection(int port) : _context(SSL_CTX_new(TLS_client_method())), _session(SSL_new(_context)) {
-        sockaddr_in address{};
-        address.sin_family = AF_INET;
-        address.sin_port = htons(static_cast<uint16_t>(port));
-        address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-        const timeval patience{20, 0};
-        setsockopt(_socket, SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
-        SSL_set_fd(_session, _socket);
-        if (connect(_socket, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0 || SSL_connect(_session) != 1)
-            throw std::runtime_error("no connection to the store");
-    }
-    ~TLSConnection() {
-        SSL_free(_session);
-        SSL_CTX_free(_context);
-        close(_socket);
-    }
-    TLSConnection(const TLSConnection&) = delete;
-
-    void write(const std::string& piece) {
-        if (SSL_write(_session, piece.data(), static_cast<int>(piece.size())) <= 0)
-            throw std::runtime_error("the store takes no more");
-    }
-    // The statuses of so many answers, fewer when they do not come.
-    std::vector<int> answers(size_t count) {
-        const std::string begin = "HTTP/1.1 ";
-        std::vector<int> all;
-        std::string text;
-        char bytes[4096];
-        for (int n; all.size() < count && (n = SSL_read(_session, bytes, sizeof bytes)) > 0;) {
-            text.append(bytes, static_cast<size_t>(n));
-            all.clear();
-            for (size_t at = 0; (at = text.find(begin, at)) != std::string::npos; at += begin.size())
-                all.push_back(std::atoi(text.c_str() + at + begin.size()));
-        }
-        return all;
-    }
-
-private:
-    SSL_CTX* _context;
-    SSL* _session;
-    int _socket = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
 };
 
 class SilentStrangers : public testing::TestWithParam<Silence> {};
