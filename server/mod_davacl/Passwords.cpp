@@ -130,11 +130,13 @@ void registerPasswords(apr_pool_t* pool) {
                               AP_AUTH_INTERNAL_PER_CONF);
 }
 
-std::optional<std::string> passwordLineOf(const request_rec* r, const std::string& user) {
+std::optional<std::string> hashInForce(const request_rec* r, const std::string& user) {
     const char* path = userFileOf(r);
     if (!path) return std::nullopt;
-    auto found = lines().find(path, user);
-    return found.answer == PasswordLines::Answer::known ? std::optional(std::move(found.hash)) : std::nullopt;
+    const auto found = lines().find(path, user);
+    if (found.answer != PasswordLines::Answer::known) return std::nullopt;
+    const char* const own = ownPasswordsOf(r);
+    return own ? OwnPasswords(own).inForce(user, found.hash) : found.hash;
 }
 
 const char* preparePasswords(apr_pool_t* pool) {

@@ -13,8 +13,8 @@ namespace rolvane::davacl {
 void registerPasswords(apr_pool_t* pool);
 // Makes the memory that the server's processes will share. A complaint, or null.
 const char* preparePasswords(apr_pool_t* pool);
-// The user's line in the user file at this moment. It differs when the password has been changed. Nothing where the
-// file or the line is missing.
-std::optional<std::string> passwordLineOf(const request_rec* r, const std::string& user);
+// The hash of the user's password at this moment: the user file's, or the one that the user has chosen. It differs when
+// the password has been changed. Nothing where the file or the user's line is missing.
+std::optional<std::string> hashInForce(const request_rec* r, const std::string& user);
 
 } // namespace rolvane::davacl

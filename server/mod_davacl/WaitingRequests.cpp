@@ -49,7 +49,7 @@ struct Waiter {
     request_rec* r = nullptr;
     const Configuration* c = nullptr;
     std::string user;
-    std::optional<std::string> password; // the line of the user file, where there is one
+    std::optional<std::string> password; // its hash, where there is one
     std::vector<TreePath> trees;
     std::vector<uint64_t> numbers; // of the trees
     std::vector<bool> told;        // of which trees; the others may not be read
@@ -76,7 +76,7 @@ bool mayRead(const Waiter& w, const TreePath& tree) {
 }
 
 bool hasPassword(const Waiter& w) {
-    return !w.password || passwordLineOf(w.r, w.user) == w.password;
+    return !w.password || hashInForce(w.r, w.user) == w.password;
 }
 
 // Everything that it was allowed at the beginning.
@@ -476,7 +476,7 @@ std::unique_ptr<Waiter> waiterFor(request_rec* r, const Configuration& c, std::v
     w->r = r;
     w->c = &c;
     w->user = r->user;
-    w->password = passwordLineOf(r, w->user);
+    w->password = hashInForce(r, w->user);
     for (const TreePath& tree : trees) w->numbers.push_back(NewsRing::numberOf(tree.owner + "/" + tree.tree()));
     w->trees = std::move(trees);
     w->told.resize(w->trees.size());

@@ -245,6 +245,19 @@ TEST_F(News, EndWithThePassword) {
     EXPECT_EQ(sam.next(), "(end)");
 }
 
+// Whoever has found the former password out hears nothing more when its owner has chosen another one.
+TEST_F(News, EndWithAPasswordOfOnesOwn) {
+    Reader sam(world, "sam", {"/dav/sam"});
+    ASSERT_EQ(sam.next(), "begin");
+    ASSERT_EQ(world.status("sam", "POST", "/principals/users/sam", {{"Content-Type", "application/x-rolvane-password"}},
+                           "chosen by sam"),
+              204);
+    const CurlClient chosen(shared->store, "sam", "chosen by sam");
+    ASSERT_EQ(chosen.request("PUT", "/sam/own-password", {}, "x").status, 201);
+    EXPECT_EQ(sam.next(), "(end)");
+    shared->store.addUser("sam", rawPasswordOf("sam"));
+}
+
 TEST(NewsOfAStore, HaveAHeartbeatAndABoundForEachUser) {
     AccessWorld world(withLines({"DavAclNewsHeartbeat 1", "DavAclNewsOfUser 2"}));
     world.reset();

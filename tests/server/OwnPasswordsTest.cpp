@@ -4,6 +4,7 @@
 #include "foundation/Paths.h"
 
 #include <filesystem>
+#include <future>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 
@@ -94,6 +95,76 @@ TEST_F(OwnPassword, IsChangedByNobodyElse) {
     EXPECT_EQ(change("", "alice", "another long word"), 401);
     EXPECT_EQ(change("sam", "nobody", "another long word"), 404);
     for (const char* user : {"alice", "sam"}) EXPECT_TRUE(signsIn(user)) << user;
+}
+
+// However the name of somebody else is written.
+TEST_F(OwnPassword, OfSomebodyElseIsReachedByNoSpelling) {
+    for (const char* path : {"/principals/users/%61lice",
+                             "/principals/users/sam/../alice",
+                             "/principals/users/sam%2f..%2falice",
+                             "//principals//users//alice",
+                             "/principals/users/alice/",
+                             "/principals/users/alice/sam",
+                             "/principals/users/alice;sam",
+                             "/principals/users/alice?sam",
+                             "/principals/./users/alice",
+                             "/principals/groups/../users/alice",
+                             "/dav/../principals/users/alice",
+                             "/principals/users/Alice",
+                             "/principals/users/alice%00sam",
+                             "/principals/users/../users/alice",
+                             "http://localhost/principals/users/alice",
+                             "/principals/users/",
+                             "/principals/users",
+                             "/principals/",
+                             "/dav/alice",
+                             "/dav/sam"}) {
+        const int status = world.status(
+            "sam", "POST", path, {{"Content-Type", kType}, {"X-HTTP-Method-Override", "PUT"}}, "another long word");
+        EXPECT_TRUE(status >= 400 && status < 500) << status << " for " << path;
+    }
+    for (const char* user : {"alice", "sam"}) EXPECT_TRUE(signsIn(user)) << user;
+    size_t files = 0;
+    for (const auto& each : std::filesystem::directory_iterator(world.store.stateDirectory() + "/own"))
+        files += each.path().extension() == ".password";
+    EXPECT_EQ(files, 0u);
+}
+
+// Two who know one password: whoever changes it first has the account, and the other one learns that.
+TEST_F(OwnPassword, OfManyWhoChangeItAtOnceOneWins) {
+    constexpr int kAtOnce = 8;
+    const auto word = [](int i) { return "the word of number " + std::to_string(i); };
+    std::vector<std::future<int>> answers;
+    for (int i = 0; i < kAtOnce; ++i)
+        answers.push_back(std::async(std::launch::async, [&, i] { return change("sam", "sam", word(i)); }));
+    int winner = -1;
+    for (int i = 0; i < kAtOnce; ++i) {
+        const int status = answers[static_cast<size_t>(i)].get();
+        if (status == 204) {
+            EXPECT_EQ(winner, -1) << "two have changed it";
+            winner = i;
+        } else {
+            EXPECT_TRUE(status == 409 || status == 401) << status;
+        }
+    }
+    ASSERT_NE(winner, -1);
+    for (int i = 0; i < kAtOnce; ++i)
+        EXPECT_EQ(CurlClient(world.store, "sam", word(i)).request("PROPFIND", "/sam/", {"Depth: 0"}).status,
+                  i == winner ? 207 : 401)
+            << i;
+    EXPECT_EQ(change("sam", "sam", word(winner)), 401) << "the same request once more";
+}
+
+TEST_F(OwnPassword, EndsWithTheAccount) {
+    ASSERT_EQ(change("sam", "sam", "another long word"), 204);
+    const CurlClient chosen(world.store, "sam", "another long word");
+    ASSERT_EQ(chosen.request("PROPFIND", "/sam/", {"Depth: 0"}).status, 207);
+    ASSERT_TRUE(world.store.removeUser("sam"));
+    EXPECT_EQ(chosen.request("PROPFIND", "/sam/", {"Depth: 0"}).status, 401);
+    EXPECT_FALSE(signsIn("sam"));
+    world.store.addUser("sam", rawPasswordOf("sam"));
+    EXPECT_EQ(chosen.request("PROPFIND", "/sam/", {"Depth: 0"}).status, 401) << "the account is another one";
+    EXPECT_TRUE(signsIn("sam"));
 }
 
 TEST_F(OwnPassword, IsRefusedInOtherForms) {
