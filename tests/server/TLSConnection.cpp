@@ -16,8 +16,8 @@ TLSConnection::TLSConnection(int port, std::string_view protocol)
     address.sin_family = AF_INET;
     address.sin_port = htons(static_cast<uint16_t>(port));
     address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    const timeval patience{20, 0};
-    setsockopt(_socket, SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
+    constexpr int kPatience = 20;
+    setPatience(kPatience);
     if (!protocol.empty()) {
         const std::string names = static_cast<char>(protocol.size()) + std::string(protocol);
         SSL_set_alpn_protos(_session, reinterpret_cast<const unsigned char*>(names.data()),
@@ -26,6 +26,12 @@ TLSConnection::TLSConnection(int port, std::string_view protocol)
     SSL_set_fd(_session, _socket);
     if (connect(_socket, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0 || SSL_connect(_session) != 1)
         throw std::runtime_error("no connection to the store");
+}
+
+void TLSConnection::setPatience(int seconds) {
+    const timeval patience{seconds, 0};
+    setsockopt(_socket, SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
+    setsockopt(_socket, SOL_SOCKET, SO_SNDTIMEO, &patience, sizeof patience);
 }
 
 TLSConnection::~TLSConnection() {

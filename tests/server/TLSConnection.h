@@ -25,6 +25,9 @@ public:
     // The statuses of so many answers (HTTP/1.1), fewer when they do not come.
     std::vector<int> answers(size_t count);
 
+    // Reads and writes give up after so many seconds instead of 20.
+    void setPatience(int seconds);
+
 private:
     SSL_CTX* _context;
     SSL* _session;
