@@ -220,7 +220,7 @@ TEST_F(DamagedRequests, NoPathLeadsAStrangerToWhatIsAlices) {
                                  : method == "ACL" ? AccessWorld::acl(AccessWorld::ace(AccessWorld::user("sam"), "all"))
                                  : method == "LOCK" ? AccessWorld::kLock
                                  : method == "PUT"  ? "written by a stranger"
-                                                    : AccessWorld::propfind("<D:getetag/>");
+                                                    : AccessWorld::propfind("getetag");
         const RawAnswer answer = world.ask("sam", method, target, headers, body);
         const std::string what = method + " " + target + (two ? " to " + destination : "");
         ASSERT_NE(answer.status, 0) << what;
