@@ -128,7 +128,9 @@ TEST_F(HTTP2Attacks, TheListsHoldHoweverARequestIsPut) {
         }
     EXPECT_EQ(allOfAlice(), before);
     for (const auto& each : std::filesystem::recursive_directory_iterator(store.userDirectory("sam")))
-        if (each.is_regular_file()) EXPECT_EQ(readFile(each.path()).find(kSecret), std::string::npos) << each.path();
+        if (each.is_regular_file()) {
+            EXPECT_EQ(readFile(each.path()).find(kSecret), std::string::npos) << each.path();
+        }
     expectThatAliceIsServed();
 }
 
