@@ -1,5 +1,7 @@
 // `rolvane books` with the real httpd and module, asked by curl.
 
+#include "BooksWorld.h"
+
 #include "foundation/CXException.h"
 #include "server/BooksServer.h"
 #include "support/UserWorld.h"
@@ -431,6 +433,43 @@ TEST_F(BooksOfAnOrdinaryUser, AServiceManagerKeepsThePortAndHandsConnectionsOn) 
     EXPECT_THAT(asked, HasSubstr("--user daemon-reload\n--user enable --now rolvane-books.socket\n"));
     EXPECT_THAT(asked, HasSubstr("--user disable --now rolvane-books.socket\n"));
     EXPECT_FALSE(std::ifstream(world.home / "config/systemd/user/rolvane-books.socket").good()) << "taken back";
+}
+
+TEST_F(BooksOfAnOrdinaryUser, ALinkIsKeptInStepByATimerOfTheServiceManager) {
+    ASSERT_EQ(symlink(ROLVANE_SOURCE_DIR "/tests/books/service-manager", (world.home / "systemctl").c_str()), 0);
+    world.home.setVariable("PATH", world.home.path() + ":" + std::getenv("PATH"));
+    BooksWorld elsewhere;
+    elsewhere.addPerson("Zoe", "There");
+    const std::string there = "http://127.0.0.1:" + std::to_string(elsewhere.port()) + kContacts;
+    ASSERT_EQ(user({"books", "on"}).status, 0);
+    const Ran linked = user(
+        {"books", "link", there, "--user", "laptop", "--password-command", "echo '" + rawPasswordOf("laptop") + "'"});
+    ASSERT_EQ(linked.status, 0) << linked;
+    EXPECT_THAT(linked.errors, HasSubstr("It is kept so every five minutes."));
+    EXPECT_EQ(user({"list", "Zoe There"}).status, 0) << "it is in step at once";
+    const std::string units = world.home / "config/systemd/user/rolvane-books-link";
+    const auto unit = [&](const std::string& kind) {
+        std::ifstream file(units + kind);
+        return std::string(std::istreambuf_iterator<char>(file), {});
+    };
+    EXPECT_THAT(unit(".timer"), HasSubstr("OnUnitActiveSec=5min\n"));
+    elsewhere.addPerson("Yan", "Later");
+    const std::string service = unit(".service"), key = "ExecStart=";
+    ASSERT_THAT(service, HasSubstr(key));
+    const size_t line = service.find(key) + key.size();
+    const Ran timed = run({"sh", "-c", service.substr(line, service.find('\n', line) - line)});
+    EXPECT_EQ(timed.status, 0) << timed;
+    EXPECT_EQ(user({"list", "Yan Later"}).status, 0) << "what the timer runs brings it";
+    const Json told = Json::parse(user({"status", "--json"}).output)["books"]["links"];
+    ASSERT_EQ(told.size(), 1U);
+    EXPECT_EQ(told[0]["url"], there);
+    EXPECT_TRUE(told[0]["good"].get<bool>());
+    EXPECT_EQ(user({"books", "unlink"}).status, 0);
+    EXPECT_EQ(unit(".timer") + unit(".service"), "");
+    std::ifstream file(world.home / "asked");
+    const std::string asked(std::istreambuf_iterator<char>(file), {});
+    EXPECT_THAT(asked, HasSubstr("--user enable --now rolvane-books-link.timer\n"));
+    EXPECT_THAT(asked, HasSubstr("--user disable --now rolvane-books-link.timer"));
 }
 
 } // namespace

@@ -4,6 +4,8 @@
 #include <gtest/gtest.h>
 
 #include <filesystem>
+#include <map>
+#include <set>
 
 // What a client finds and reads, by raw HTTP.
 
@@ -57,6 +59,39 @@ TEST(Books, SayWhatAClientNeedsToKnow) {
     EXPECT_NE(book.property("CS:getctag"), "");
     EXPECT_THAT(book.property("D:current-user-privilege-set"), HasSubstr("<D:write-content/>"));
     EXPECT_THAT(answer.body, Not(HasSubstr("404")));
+}
+
+TEST(Books, HaveNamesAndColoursThatStay) {
+    BooksWorld world;
+    const auto ann = world.addPerson("Ann", "Lee");
+    std::map<std::string, std::string> names{{kContacts, "Contacts"}};
+    for (const char* name : {"Friends", "Choir", "Works & Co", "Neighbours", "Club"})
+        names["/books/home/group-" + BooksWorld::uuidOf(world.addGroup(name, {ann})) + "/"] = name;
+    const auto look = [&] {
+        std::map<std::string, std::string> colours;
+        const auto answer = world.propfind(
+            "/books/home/", 1, "<D:displayname/><I:addressbook-color xmlns:I=\"http://inf-it.com/ns/ab/\"/>");
+        for (const BookResponse& book : answer.responses()) {
+            if (!names.contains(book.href)) continue;
+            std::string name = book.property("D:displayname");
+            if (const size_t at = name.find("&amp;"); at != std::string::npos) name.replace(at, 5, "&");
+            EXPECT_EQ(name, names.at(book.href));
+            const size_t hash = book.text.find('#');
+            colours[book.href] = hash == std::string::npos ? answer.body : book.text.substr(hash, 9);
+        }
+        return colours;
+    };
+    const auto colours = look();
+    ASSERT_EQ(colours.size(), names.size());
+    std::set<std::string> different;
+    for (const auto& [book, colour] : colours) {
+        EXPECT_THAT(colour, testing::MatchesRegex("#[0-9a-f]+")) << book;
+        EXPECT_EQ(colour.size(), 9U) << "red, green, blue and how opaque it is";
+        different.insert(colour);
+    }
+    EXPECT_GT(different.size(), 1U);
+    world.restart();
+    EXPECT_EQ(look(), colours);
 }
 
 TEST(Books, AskWhoItIs) {
