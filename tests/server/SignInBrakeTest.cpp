@@ -35,6 +35,33 @@ TEST(SignInBrake, PausesAfterFiveWrongOnesAndEachPauseIsTwiceAsLong) {
     }
 }
 
+// Many guesses at the same moment count as many, not as one.
+TEST(SignInBrake, LooksAtFiveAtATimeAndAtOneBehindAPause) {
+    const Brake brake(SignInBrake::map());
+    const uint64_t place = SignInBrake::place("phone", "abcd");
+    int looked = 0;
+    for (int i = 0; i < 100; ++i) looked += brake->looks(place, 5000);
+    EXPECT_EQ(looked, 5);
+    for (int i = 0; i < looked; ++i) brake->wrong(place, 5000);
+    const int64_t later = 5000 + SignInBrake::kFirstPause;
+    looked = 0;
+    for (int i = 0; i < 100; ++i) looked += brake->looks(place, later);
+    EXPECT_EQ(looked, 1);
+    EXPECT_TRUE(brake->looks(place, later + SignInBrake::kLongestLook)) << "whoever looked has died";
+}
+
+// Wrong passwords for other names do not make it forget, whatever they are.
+TEST(SignInBrake, IsNotLedToForgetByNamesThatNobodyHas) {
+    const Brake brake(SignInBrake::map());
+    const uint64_t place = SignInBrake::place("phone", "abcd");
+    constexpr uint64_t kSlots = 4096, kNames = 100;
+    for (int i = 0; i < 5; ++i) brake->wrong(place, 5000);
+    for (uint64_t i = 1; i < kNames; ++i)
+        brake->wrong(place + i * kSlots, 5000); // one slot in a table by the remainder
+    EXPECT_FALSE(brake->looks(place, 5001));
+    EXPECT_EQ(brake->wrong(place, 5001), 2 * SignInBrake::kFirstPause);
+}
+
 TEST(SignInBrake, HoldsUpNobodyElse) {
     const Brake brake(SignInBrake::map());
     const uint64_t place = SignInBrake::place("phone", "abcd");
