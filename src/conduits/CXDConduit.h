@@ -109,6 +109,12 @@ public:
         return applyChangeRecordIfNeeded(record, nullptr);
     }
 
+    // What of a user's group the stores do not have yet, and with it the contents of new members. None: this source
+    // cannot tell. Base: none.
+    virtual std::optional<CXDChangeRecords> changesOfGroupNow(const UserName& /*user*/, const UniqueId& /*group*/) {
+        return std::nullopt;
+    }
+
     // The next gathering makes the same change by itself, for as long as it is to be made. Base: no.
     virtual bool findsAgain(const CXDChangeRecord& /*record*/) const { return false; }
 

@@ -129,6 +129,14 @@ TEST(GroupComparison, ARenamedGroupCarriesItsNewName) {
     EXPECT_EQ(made[0]->payload(), Value("New"));
 }
 
+TEST(GroupComparison, ANameThatTheDatabaseGaveToAGroupWithoutOneIsNobodysEdit) {
+    const Dictionary nameless{{kMemberUIDState, Array()}, {kSubgroupUIDState, Array()}};
+    const Dictionary given = state({}, "untitled group");
+    EXPECT_EQ(steps(nameless, given, kOwners), Texts{});
+    EXPECT_EQ(steps(nameless, state({}, "Friends"), kOwners), Texts{"4 <self> - G:CXGroup 4"});
+    EXPECT_EQ(steps(state({}, "Friends"), given, kOwners), Texts{"4 <self> - G:CXGroup 4"}) << "somebody has typed it";
+}
+
 TEST(GroupComparison, RenamingTheAllContactsGroupGivesNothing) {
     EXPECT_EQ(steps(state({}, "Old"), state({}, "New"), kAll), Texts{});
 }

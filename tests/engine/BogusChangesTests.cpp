@@ -33,6 +33,25 @@ protected:
         state.set(kMemberUIDState, listed);
         rewrite(stateOf(group), PropertyList::toXML(state));
     }
+    // The list of everybody names the group from now on.
+    void list(const std::string& group) {
+        const std::filesystem::path place = world->file(std::string(kCXAllGroupUID));
+        const std::filesystem::path file =
+            std::filesystem::is_directory(place) ? place / CXDAVManager::kStateName : place;
+        Dictionary everybody = contentOf(file).mutableCopy();
+        Array groups = everybody[kSubgroupUIDState].array().mutableCopy();
+        groups.append(group);
+        everybody.set(kSubgroupUIDState, groups);
+        rewrite(file, PropertyList::toXML(everybody));
+    }
+    void letBobWrite() {
+        CXMutableMultiValue writers;
+        writers.addValue("bob", "bob");
+        for (const char* each : {kCXReadSharingACLProperty, kCXReadWriteSharingACLProperty})
+            alice.application->allGroup()->setValue(writers, each);
+        alice.application->save();
+        alice.start();
+    }
 };
 
 TEST_F(BogusChanges, ADeletionIsNotGivenUpForAnotherVersionOnTheStore) {
@@ -85,26 +104,38 @@ TEST_F(BogusChanges, AGroupThatWasLeftWhereItIsComesWhenSomebodyMayWrite) {
     const std::string name = strange->uniqueId().str();
     rewrite(world->file(name), PropertyList::toXML(Dictionary{{kCXGroupNameProperty, "Strange"},
                                                               {kMemberUIDState, Array{people[0]->uniqueId().str()}}}));
-    const std::filesystem::path list = world->file(std::string(kCXAllGroupUID));
-    const std::filesystem::path file = std::filesystem::is_directory(list) ? list / CXDAVManager::kStateName : list;
-    Dictionary everybody = contentOf(file).mutableCopy();
-    Array groups = everybody[kSubgroupUIDState].array().mutableCopy();
-    groups.append(name);
-    everybody.set(kSubgroupUIDState, groups);
-    rewrite(file, PropertyList::toXML(everybody));
+    list(name);
     settle();
     ASSERT_EQ(alice.application->recordForUniqueId(strange->uniqueId()), nullptr);
-    CXMutableMultiValue writers;
-    writers.addValue("bob", "bob");
-    for (const char* each : {kCXReadSharingACLProperty, kCXReadWriteSharingACLProperty})
-        alice.application->allGroup()->setValue(writers, each);
-    alice.application->save();
-    alice.start();
+    letBobWrite();
     settle();
     const auto come = std::dynamic_pointer_cast<CXGroup>(alice.application->recordForUniqueId(strange->uniqueId()));
     ASSERT_TRUE(come) << log.text();
     EXPECT_EQ(come->name(), "Strange");
     EXPECT_EQ(come->memberUniqueIds(), std::vector{people[0]->uniqueId()});
+}
+
+// Its writer was interrupted between the members and the name.
+TEST_F(BogusChanges, AGroupThatComesBeforeItsNameGetsTheNameWhenThatComes) {
+    letBobWrite();
+    settle();
+    const CXGroupRef half = CXGroup::create();
+    const std::string name = half->uniqueId().str();
+    Dictionary content{{kMemberUIDState, Array{people[0]->uniqueId().str()}}};
+    rewrite(world->file(name), PropertyList::toXML(content));
+    list(name);
+    settle();
+    const auto come = std::dynamic_pointer_cast<CXGroup>(alice.application->recordForUniqueId(half->uniqueId()));
+    ASSERT_TRUE(come) << log.text();
+    EXPECT_EQ(come->name(), "untitled group");
+    const std::filesystem::path file = stateOf(come);
+    EXPECT_FALSE(contentOf(file).contains(kCXGroupNameProperty)) << "nobody has given it one\n" << log.text();
+    content = contentOf(file).mutableCopy();
+    content.set(kCXGroupNameProperty, "Choir");
+    rewrite(file, PropertyList::toXML(content));
+    settle();
+    EXPECT_EQ(come->name(), "Choir") << log.text();
+    EXPECT_EQ(contentOf(file)[kCXGroupNameProperty], Value("Choir"));
 }
 
 } // namespace rolvane::test

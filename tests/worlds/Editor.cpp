@@ -73,6 +73,11 @@ View Editor::view(CXRolvane& database, const RemoteLocation& location) {
         const std::string name = shared(each.uniqueId);
         if (!view.groups.emplace(name, cellsOf(*group, view.faults)).second) view.faults.push_back(name + " twice");
         for (const auto& [cell, value] : view.groups[name]) view.whole[name] += cell + "=" + value + " ";
+        std::map<std::string, std::string> choices;
+        for (const auto& [member, chosen] : group->distributionChoices())
+            for (const auto& [property, identifier] : chosen)
+                choices[shared(member) + " uses"] += " " + property + "/" + identifier;
+        for (const auto& [member, text] : choices) view.whole[name] += member + text + " ";
     }
     return view;
 }
@@ -169,6 +174,9 @@ void Editor::edit(const Habits& habits) {
             at -= kind.weight;
         }
     }
+    // With a chance of its own: worlds without such choices stay the same else.
+    Chance chance(hashOf("choose", hashOf(_stamp, _count)));
+    if (chance.happens(habits.choose)) choose(chance);
     save();
 }
 
@@ -287,6 +295,21 @@ void Editor::unnest(bool turned) {
         if (turned) nest(out, outer);
         return;
     }
+}
+
+// The model does not know of it; the copies have to agree.
+void Editor::choose(Chance chance) {
+    const auto all = groups();
+    if (all.empty()) return;
+    const CXGroupRef& group = chance.oneOf(all);
+    const auto members = group->members();
+    if (members.empty()) return;
+    const CXPersonRef& person = chance.oneOf(members);
+    const auto phones = person->multiValueForProperty(kCXPhoneProperty);
+    if (!phones || phones->empty()) return;
+    const bool clears = chance.happens(0.3);
+    const auto chosen = clears ? std::nullopt : std::optional(chance.oneOf(phones->entries()).identifier);
+    group->setDistributionIdentifier(chosen, kCXPhoneProperty, person);
 }
 
 } // namespace rolvane::worlds

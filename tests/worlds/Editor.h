@@ -15,6 +15,7 @@ struct Habits {
     size_t text = 30, phone = 12, make = 9, remove = 7, makeGroup = 4, removeGroup = 2, rename = 6, join = 12,
            leave = 8, nest = 4, unnest = 3, turn = 3, removeAll = 0;
     size_t most = 4;       // edits in one save
+    double choose = 0.25;  // of saves that also say which phone of a member a group uses
     bool leaveOne = false; // the last contact stays
 };
 
@@ -62,6 +63,7 @@ private:
     void leave();
     bool nest(const CXGroupRef& outer, const CXGroupRef& inner);
     void unnest(bool turned);
+    void choose(Chance chance);
     void addPhone(CXPerson& person);
     void note(Deed::Kind kind, const CXRecord& record, std::string cell = {}, std::string before = {},
               std::string after = {});

@@ -2,6 +2,7 @@
 
 #include "conduits/PublishedLayout.h"
 #include "contacts/records/Constants.h"
+#include "contacts/records/RecordKind.h"
 #include "model/PayloadKeys.h"
 
 namespace rolvane {
@@ -16,7 +17,7 @@ UniqueId identifierIn(const Value& element) { // shares the text
 class Comparison {
 public:
     Comparison(const Value& prior, const Value& current, const GroupAddress& address)
-        : _prior(prior.dictionary()), _current(current.dictionary()), _address(address),
+        : _isKnown(prior), _prior(prior.dictionary()), _current(current.dictionary()), _address(address),
           _isAllGroup(address.guid.str() == layout::kAllGroup) {}
 
     void newGroup() {
@@ -59,6 +60,9 @@ public:
     void name() {
         if (_isAllGroup) return; // every database names its own
         const Value now = Value(_current[kCXGroupNameProperty].string());
+        // A group that came without a name was given one by the database and by nobody else. The real one may follow.
+        if (_isKnown && !_prior.contains(kCXGroupNameProperty) && now == Value(defaultGroupName(RecordKind::group)))
+            return;
         if (now != _prior[kCXGroupNameProperty]) add(CXDChangeGroupName, {}, _address.guid, now);
     }
 
@@ -95,6 +99,7 @@ private:
         _steps.push_back(std::move(record));
     }
 
+    const bool _isKnown;
     const Dictionary _prior, _current;
     const GroupAddress& _address;
     const bool _isAllGroup;

@@ -11,10 +11,9 @@
 #include "engine/queue/Mingler.h"
 #include "engine/queue/RecordIdentity.h"
 #include "engine/queue/RefusedChanges.h"
-#include "engine/recovery/GoneThings.h"
 #include "engine/recovery/Holdings.h"
+#include "engine/recovery/Restatement.h"
 #include "engine/recovery/UnderWay.h"
-#include "engine/recovery/UnsettledGroups.h"
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
 #include "foundation/TestSwitch.h"
@@ -38,16 +37,6 @@ CXDChangeRecords mingled(const CXDChangeRecords& input) {
     Mingler mingler;
     mingler.mingle(input);
     return mingler.takeMingled();
-}
-
-// Without what waits for other trees, which have groups of the same names, and for sources that no pass writes to.
-Dictionary unsettledOwnGroups(const CXDChangeRecords& records, size_t fresh) {
-    if (records.size() <= fresh) return {};
-    const auto queue = records.begin() + static_cast<std::ptrdiff_t>(fresh);
-    CXDChangeRecords own = ownWrites({records.begin(), queue});
-    const size_t freshOwn = own.size();
-    append(own, ownWrites({queue, records.end()}));
-    return unsettledGroups(own, freshOwn);
 }
 
 // Tells the file managers what the apply loop is going to read, and that it has ended.
@@ -146,10 +135,7 @@ void ApplyLoop::applyAll(bool trickle) {
     setAside(fresh);
     _underWay =
         underWayInAnyForm(_parts.state.underWay()); // of a pass that was killed, or what an earlier one left adrift
-    _unsettled = unsettledGroups(_unhandled, fresh);
-    for (const auto& [group, isSo] : unsettledOwnGroups(_unhandled, fresh)) noteUnsure(UniqueId(group));
-    withdrawWhatIsGone(_unhandled, fresh, _parts.with.rolvane, hasCopies());
-    dropRemovalsOfWhatIsBack(_unhandled, fresh, _parts.with.rolvane);
+    restatement().restate(_unhandled, fresh);
     settleUnderWay();
     queue();
     _parts.with.progress.startedPhase(3);
@@ -190,8 +176,9 @@ void ApplyLoop::setAside(size_t fresh) {
     if (_setAside.empty()) return;
     const std::unordered_set<CXDChangeRecordPtr, RecordHash, RecordEqual> again(_unhandled.begin(), _unhandled.end());
     std::erase_if(_setAside, [&](const CXDChangeRecordPtr& record) { return again.contains(record); });
-    withdrawWhatIsGone(_setAside, 0, _parts.with.rolvane, hasCopies());
-    dropRemovalsOfWhatIsBack(_setAside, 0, _parts.with.rolvane);
+    const Restatement restatement = this->restatement();
+    restatement.withdrawWhatIsGone(_setAside, 0);
+    restatement.dropRemovalsOfWhatIsBack(_setAside, 0);
     _setAside = flattenGroupChanges(mingled(_setAside));
     for (const CXDChangeRecordPtr& record : _setAside) record->packPayload();
 }
@@ -255,6 +242,10 @@ void ApplyLoop::noteUnderWay() {
     if (_gatheringChanged) _parts.state.putConduitDataWith(_parts.marksOfThePass);
     _parts.with.rolvane.save();
     commit.commit();
+}
+
+Restatement ApplyLoop::restatement() const {
+    return {_parts.with.rolvane, *_parts.conduits.cx, hasCopies()};
 }
 
 // The database has contacts of these users: of its own one, and of those whose subscription has not been replaced.

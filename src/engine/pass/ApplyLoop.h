@@ -18,6 +18,7 @@
 namespace rolvane {
 
 class OutOfOrderWork;
+struct Restatement;
 
 // One apply pass, from the records that were gathered to the queue that is left. Built for one pass on the main thread.
 //
@@ -43,6 +44,7 @@ private:
     void applyAll(bool trickle);
     void settleUnderWay();
     std::vector<SharedTree> treesOf(const Dictionary& underWay) const;
+    Restatement restatement() const;
     std::function<bool(const UserName&)> hasCopies() const;
     Dictionary withSubscriptions(Dictionary underWay) const;
     std::vector<std::pair<UserName, CXSubscriptionRef>> subscriptionsOf(const Dictionary& underWay) const;

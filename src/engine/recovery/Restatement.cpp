@@ -1,11 +1,18 @@
-#include "engine/recovery/GoneThings.h"
+#include "engine/recovery/Restatement.h"
 
+#include "conduits/CXDConduit.h"
+#include "contacts/database/CXRolvane.h"
 #include "contacts/records/CXGroup.h"
+#include "contacts/records/Constants.h"
+#include "contacts/records/Identifier.h"
 #include "engine/recovery/Holdings.h"
 #include "foundation/TestSwitch.h"
 #include "model/PayloadKeys.h"
 
 #include <algorithm>
+#include <iterator>
+#include <set>
+#include <utility>
 
 namespace rolvane {
 
@@ -47,10 +54,15 @@ void withdrawMembers(const CXDChangeRecord& composite, Holdings& holdings, CXDCh
         }
 }
 
+// A change of what a group is or holds, for its store alone; its deletion is none.
+bool isOfGroup(const CXDChangeRecord& record) {
+    return record.initialSource() == CXDSyncSourceCX && record.appliesToSources() == CXDSyncSourceVaultra &&
+           record.user() && record.group() && *record.group() != kPeopleGroup && record.type() != CXDDeleteGroup;
+}
+
 } // namespace
 
-void withdrawWhatIsGone(CXDChangeRecords& records, size_t fresh, CXRolvane& rolvane,
-                        const std::function<bool(const UserName& user)>& hasCopies) {
+void Restatement::withdrawWhatIsGone(CXDChangeRecords& records, size_t fresh) const {
     if (isLeftOut("what is gone")) return;
     Holdings holdings(rolvane);
     CXDChangeRecords removals;
@@ -67,7 +79,7 @@ void withdrawWhatIsGone(CXDChangeRecords& records, size_t fresh, CXRolvane& rolv
     for (CXDChangeRecordPtr& record : removals) records.push_back(std::move(record));
 }
 
-void dropRemovalsOfWhatIsBack(CXDChangeRecords& records, size_t fresh, CXRolvane& rolvane) {
+void Restatement::dropRemovalsOfWhatIsBack(CXDChangeRecords& records, size_t fresh) const {
     if (isLeftOut("what is back")) return;
     const auto found = [&](const UniqueId& uid, std::string_view table) {
         return rolvane.recordForUniqueId(cxUIDWithTableName(uid, table));
@@ -82,6 +94,34 @@ void dropRemovalsOfWhatIsBack(CXDChangeRecords& records, size_t fresh, CXRolvane
     };
     const auto queue = records.begin() + static_cast<std::ptrdiff_t>(fresh);
     records.erase(std::remove_if(queue, records.end(), isBack), records.end());
+}
+
+void Restatement::compareGroups(CXDChangeRecords& records, size_t fresh) const {
+    std::set<std::pair<UserName, UniqueId>> groups;
+    for (size_t i = fresh; i < records.size(); ++i)
+        if (isOfGroup(*records[i]) && hasCopies(*records[i]->user()))
+            groups.emplace(*records[i]->user(), cxUIDWithTableName(*records[i]->group(), kCXGroupTable));
+    CXDChangeRecords now;
+    std::erase_if(groups, [&](const auto& of) {
+        auto changes = database.changesOfGroupNow(of.first, of.second);
+        if (!changes) return true;
+        std::move(changes->begin(), changes->end(), std::back_inserter(now));
+        return false;
+    });
+    const auto queue = records.begin() + static_cast<std::ptrdiff_t>(fresh);
+    const auto isRestated = [&](const CXDChangeRecordPtr& record) {
+        return isOfGroup(*record) &&
+               groups.contains({*record->user(), cxUIDWithTableName(*record->group(), kCXGroupTable)});
+    };
+    records.erase(std::remove_if(queue, records.end(), isRestated), records.end());
+    std::move(now.begin(), now.end(), std::back_inserter(records));
+}
+
+void Restatement::restate(CXDChangeRecords& records, size_t fresh) const {
+    if (records.size() <= fresh) return;
+    withdrawWhatIsGone(records, fresh);
+    dropRemovalsOfWhatIsBack(records, fresh);
+    compareGroups(records, fresh);
 }
 
 } // namespace rolvane
