@@ -89,6 +89,10 @@ void killCXD(EngineParts& parts) {
     std::abort(); // an end that returns is no end
 }
 
+void claimState(EngineParts& parts) {
+    parts.state.claim(parts.with.rolvane.shareCount(), parts.with.account.vaultraUser());
+}
+
 void checkCXShareCount(EngineParts& parts) {
     Preferences& preferences = parts.with.preferences;
     const Value count = preferences.get(kDaemonDomain, kCXDShareCount);

@@ -363,11 +363,12 @@ TEST_F(TwoWriters, AContactThatIsNowhereAndThatAWriterHasListedIsNamedNoLonger) 
         return stateOf(UniqueId(kCXAllGroupUID))["memberUIDState"].array().containsString(gone.str());
     };
     ASSERT_TRUE(listed()) << log.text();
-    for (int round = 0; round < 3; ++round)
-        for (Participant* each : {&alice, &bob}) each->pass();
+    for (int round = 0; round < 3; ++round) alice.pass(); // Bob's daemon, which knows that it was he, would take it back
+    EXPECT_TRUE(listed()) << "the contact may be on its way\n" << log.text();
     alice.clock.ahead = kPatience + 1;
-    for (Participant* each : {&alice, &bob}) each->pass();
+    alice.pass();
     EXPECT_FALSE(listed()) << log.text();
+    for (Participant* each : {&bob, &alice}) each->pass();
     EXPECT_EQ(copies(), alice.view()) << log.text();
     for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
 }

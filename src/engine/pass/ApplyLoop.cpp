@@ -4,16 +4,12 @@
 #include "contacts/database/DamagedDatabase.h"
 #include "contacts/records/Constants.h"
 #include "contacts/records/Identifier.h"
-#include "engine/memory/PassCommit.h"
 #include "engine/memory/PublicationCache.h"
 #include "engine/pass/OutOfOrderWork.h"
 #include "engine/queue/ChangeQueue.h"
 #include "engine/queue/Mingler.h"
 #include "engine/queue/RecordIdentity.h"
 #include "engine/queue/RefusedChanges.h"
-#include "engine/recovery/Holdings.h"
-#include "engine/recovery/Restatement.h"
-#include "engine/recovery/UnderWay.h"
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
 #include "foundation/TestSwitch.h"
@@ -71,17 +67,13 @@ private:
 
 } // namespace
 
-bool isGivenUp(EngineParts& parts, const CXDChangeRecord& record) {
-    const bool isOfCopy = record.initialSource() == CXDSyncSourceCX && !record.changeMadeByDataOwner();
-    return !isOfCopy && parts.denied.contains(record);
-}
-
 void saveACLs(EngineParts& parts) {
     parts.conduits.vaultra->saveACLs();
     parts.conduits.cx->saveACLs();
 }
 
-ApplyLoop::ApplyLoop(EngineParts& parts, Actions actions) : _parts(parts), _actions(std::move(actions)) {}
+ApplyLoop::ApplyLoop(EngineParts& parts, Actions actions)
+    : _parts(parts), _actions(std::move(actions)), _recovery(parts), _arrived(parts), _refusals(parts) {}
 ApplyLoop::~ApplyLoop() = default;
 
 void ApplyLoop::run(CXDChangeRecords records, bool trickle, bool allowRetry) {
@@ -133,35 +125,12 @@ void ApplyLoop::applyAll(bool trickle) {
     append(_unhandled, _parts.state.getPendingChanges());
     _queueTaken = true;
     setAside(fresh);
-    _underWay =
-        underWayInAnyForm(_parts.state.underWay()); // of a pass that was killed, or what an earlier one left adrift
-    restatement().restate(_unhandled, fresh);
-    settleUnderWay();
+    _recovery.begin(_unhandled, fresh);
     queue();
     _parts.with.progress.startedPhase(3);
     split();
     applyOutOfOrder();
     applyInOrder();
-}
-
-void ApplyLoop::settleUnderWay() {
-    for (const SharedTree& tree : treesOf(*_underWay))
-        _parts.state.withConduitData([&](Dictionary& data) {
-            const Dictionary left = rolvane::settleUnderWay(*_underWay, tree, _unhandled, data, _parts.with.rolvane);
-            _end.unread = underWayTogether(_end.unread, left);
-        });
-}
-
-// The own one, and those of others whose subscription is still the one by which the copies came.
-std::vector<SharedTree> ApplyLoop::treesOf(const Dictionary& underWay) const {
-    std::vector<SharedTree> trees;
-    CXRolvane& rolvane = _parts.with.rolvane;
-    const auto isRead = [&](const UserName& user) { return _parts.outcomes.lookAt(user) == TreeLook::read; };
-    if (underWay.contains(kSelf.str())) trees.push_back({kSelf, rolvane.allGroup(), isRead(kSelf)});
-    for (const auto& [user, subscription] : subscriptionsOf(underWay))
-        if (underWay[user.str()].dictionary()[kSubscription] == Value(subscription->uniqueId()))
-            trees.push_back({user, rolvane.allGroupForRemoteLocation(subscription->remoteLocation()), isRead(user)});
-    return trees;
 }
 
 // What waits for the shared folder alone is applied by no pass, and says nothing about what the store holds: news of
@@ -176,9 +145,7 @@ void ApplyLoop::setAside(size_t fresh) {
     if (_setAside.empty()) return;
     const std::unordered_set<CXDChangeRecordPtr, RecordHash, RecordEqual> again(_unhandled.begin(), _unhandled.end());
     std::erase_if(_setAside, [&](const CXDChangeRecordPtr& record) { return again.contains(record); });
-    const Restatement restatement = this->restatement();
-    restatement.withdrawWhatIsGone(_setAside, 0);
-    restatement.dropRemovalsOfWhatIsBack(_setAside, 0);
+    _recovery.restateForTheFolder(_setAside);
     _setAside = flattenGroupChanges(mingled(_setAside));
     for (const CXDChangeRecordPtr& record : _setAside) record->packPayload();
 }
@@ -206,10 +173,7 @@ void ApplyLoop::queue() {
     putNewsOfGroupsLast(accepted);
     LostInFolds lost;
     CXDChangeRecords flat = flattenGroupChanges(accepted, &lost);
-    for (const auto& groups : {lost.lists, lost.contents})
-        for (const UniqueId& group : groups)
-            if (!isLeftOut("lost in folds")) _unsettled.set(group.str(), true);
-    for (const UniqueId& group : lost.contents) noteUnsure(group);
+    _recovery.lostInFolds(lost);
     sortByType(flat);
     _totalCount = flat.size();
     _processedCount = 0;
@@ -223,77 +187,16 @@ void ApplyLoop::split() {
     for (CXDChangeRecordPtr& record : _unhandled)
         (record->canApplyOutOfOrder() ? outOfOrder : _inOrder).push_back(std::move(record));
     _unhandled.clear();
-    const Dictionary now = withSubscriptions(underWay(outOfOrder));
-    _underWay = underWayTogether(*_underWay, now);
-    _end.removed = removedBy(outOfOrder);
-    _gatheringChanged = _parts.with.rolvane.hasUnsavedChanges();
-    _parts.conduits.vaultra->willWrite(outOfOrder);
-    _outOfOrder = std::make_unique<OutOfOrderWork>(_parts, std::move(outOfOrder));
-    if (!now.empty() && !isLeftOut("note before the workers")) noteUnderWay();
-}
-
-// What cannot be noted is not done: a later pass would find it on the store, take it for somebody else's, and bring it
-// back over what the owner has changed meanwhile.
-void ApplyLoop::noteUnderWay() {
-    PassCommit commit(_parts.with.rolvane, _parts.with.preferences, _parts.state);
-    claimState();
-    _parts.state.setUnderWay(*_underWay);
-    // Access lists and removals that came from the store are saved together with the states that know them.
-    if (_gatheringChanged) _parts.state.putConduitDataWith(_parts.marksOfThePass);
-    _parts.with.rolvane.save();
-    commit.commit();
-}
-
-Restatement ApplyLoop::restatement() const {
-    return {_parts.with.rolvane, *_parts.conduits.cx, hasCopies()};
-}
-
-// The database has contacts of these users: of its own one, and of those whose subscription has not been replaced.
-std::function<bool(const UserName&)> ApplyLoop::hasCopies() const {
-    std::unordered_set<UserName> users{kSelf};
-    for (const CXSubscriptionRef& subscription : _parts.with.rolvane.subscriptions()) {
-        const RemoteLocation location = subscription->remoteLocation();
-        const auto user = userForRemoteLocation(location, _parts.with.account.vaultraUser(), _parts.with.loginName);
-        if (user && !_parts.state.isOfFormerSubscription(location, subscription->uniqueId())) users.insert(*user);
-    }
-    return [users = std::move(users)](const UserName& user) { return users.contains(user); };
-}
-
-// Adds the present subscription to each tree of somebody else. Copies of a former subscription are gone, though nobody
-// has deleted them.
-Dictionary ApplyLoop::withSubscriptions(Dictionary underWay) const {
-    for (const auto& [user, subscription] : subscriptionsOf(underWay))
-        underWay.dictionaryFor(user.str()).set(kSubscription, subscription->uniqueId());
-    return underWay;
-}
-
-std::vector<std::pair<UserName, CXSubscriptionRef>> ApplyLoop::subscriptionsOf(const Dictionary& underWay) const {
-    std::vector<std::pair<UserName, CXSubscriptionRef>> all;
-    if (underWay.empty()) return all;
-    for (const CXSubscriptionRef& subscription : _parts.with.rolvane.subscriptions()) {
-        const auto user = userForRemoteLocation(subscription->remoteLocation(), _parts.with.account.vaultraUser(),
-                                                _parts.with.loginName);
-        if (user && *user != kSelf && underWay.contains(user->str())) all.emplace_back(*user, subscription);
-    }
-    return all;
+    _outOfOrder = std::make_unique<OutOfOrderWork>(_parts, outOfOrder);
+    _recovery.willWrite(outOfOrder);
 }
 
 void ApplyLoop::applyOutOfOrder() {
     _outOfOrder->start(configuredWorkers(_parts.with.account));
     _outOfOrder->wait();
     _processedCount += _outOfOrder->processedCount();
-    noteRefused(); // before anything of this pass is saved
+    _refusals.note();
     takeInMerged();
-}
-
-void ApplyLoop::noteRefused() {
-    if (_parts.denied.empty()) return;
-    _parts.state.withConduitData([&](Dictionary& data) {
-        noteRefusedChanges(
-            data, _parts.denied.all(), _parts.denied.refused(),
-            [&](const CXDChangeRecord& record) { return _parts.conduits.vaultra->findsAgain(record); },
-            _parts.with.clock.now());
-    });
 }
 
 // What was merged on its way to the store is taken into the database as if it had come from there.
@@ -306,6 +209,7 @@ void ApplyLoop::takeInMerged() {
 
 void ApplyLoop::applyInOrder() {
     constexpr size_t kFew = 50;
+    _left.emplace(_parts, _takenOut, _outOfOrder->pending());
     const ReadingAhead ahead(_inOrder, *_parts.conduits.cx);
     for (; _inOrderDone < _inOrder.size(); ++_inOrderDone) {
         const CXDChangeRecordPtr record = _inOrder[_inOrderDone]; // there may be more on the way
@@ -318,88 +222,25 @@ void ApplyLoop::applyInOrder() {
     takeInMerged();
 }
 
-// A version of a contact that has come while our own one could not be written: taken in now, it would stand here while
-// ours, which is written with the next pass, stands on the store. It is left unread, and offered again until then.
-bool ApplyLoop::meetsOwnWaitingWrite(const CXDChangeRecord& record) {
-    if (record.type() != CXDUpdateRecord || record.initialSource() == CXDSyncSourceCX || !record.person()) return false;
-    if (!_waitingWrites) {
-        _waitingWrites.emplace();
-        for (const CXDChangeRecordPtr& waiting : _outOfOrder->pending())
-            if (waiting->type() == CXDUpdateRecord && waiting->initialSource() == CXDSyncSourceCX &&
-                waiting->person() && (waiting->appliesToSources() & CXDSyncSourceVaultra))
-                _waitingWrites->emplace(waiting->user().value_or(UserName()), cxNormalizedUID(*waiting->person()));
-        for (const std::string& person : _parts.state.conduitObjectForKey(kConduitCX, kUnsettledPeople).allKeys())
-            _waitingWrites->emplace(kSelf, UniqueId(person)); // refused, and to be sent again
-    }
-    return !_waitingWrites->empty() &&
-           _waitingWrites->contains({record.user().value_or(UserName()), cxNormalizedUID(*record.person())});
-}
-
-// A change of another user's publication that concerns what is deleted here. Where the deletion was refused, the change
-// is what brings it back. Elsewhere it is left, and offered again should there be anything of it.
-bool ApplyLoop::isOfWhatWasTakenOutHere(const CXDChangeRecord& record) {
-    if (record.initialSource() == CXDSyncSourceCX || !_takenOut.concerns(record)) return false;
-    if (!_refusedUsers) {
-        _refusedUsers.emplace();
-        for (const CXDChangeRecordPtr& refused : _parts.denied.all())
-            _refusedUsers->insert(refused->user().value_or(UserName()));
-    }
-    return !_refusedUsers->contains(record.user().value_or(UserName()));
-}
-
 // The change that asked for it is done, and what is known says so.
 void ApplyLoop::saveInThePass() {
     if (!std::exchange(_parts.saveInThePass, false)) return;
-    PassCommit commit(_parts.with.rolvane, _parts.with.preferences, _parts.state);
-    claimState();
-    listArrived();
-    _parts.state.putConduitDataWith(_parts.marksOfThePass);
-    commit.commit();
-}
-
-// The database has everybody in its list of all as soon as they are there. The change that says so comes later in the
-// pass: were it killed in between, the next one would take them for the user's own.
-void ApplyLoop::listArrived() {
-    if (isLeftOut("listing of what arrived")) return;
-    if (!_listings) {
-        _listings.emplace();
-        for (size_t i = _inOrderDone; i < _inOrder.size(); ++i) {
-            const CXDChangeRecord& record = *_inOrder[i];
-            const bool lists = record.type() == CXDAddRecordToGroup || record.type() == CXDAddGroupToGroup;
-            if (lists && (record.appliesToSources() & CXDSyncSourceCX) && record.initialSource() != CXDSyncSourceCX &&
-                record.user() && record.person() && record.group() &&
-                cxUIDWithTableName(*record.group(), kCXGroupTable).str() == kCXAllGroupUID)
-                _listings->emplace(std::pair(*record.user(), cxNormalizedUID(*record.person())), _inOrder[i]);
-        }
-    }
-    for (const CXDChangeRecordPtr& record : std::exchange(_arrived, {})) {
-        const UniqueId& who = record->type() == CXDUpdateRecord ? *record->person() : *record->group();
-        const auto listing = _listings->find({*record->user(), cxNormalizedUID(who)});
-        if (listing == _listings->end() || !_parts.conduits.cx->holds(*listing->second)) continue;
-        _parts.state.withConduitData(
-            [&](Dictionary& data) { didApplyChange(data, *listing->second, CXDSyncSourceCX); });
-    }
-}
-
-// A first pass has this done long before it ends. Killed behind its first save, it would be a first pass again, for
-// which nothing of what is there came from a store.
-void ApplyLoop::claimState() {
-    _parts.state.claim(_parts.with.rolvane.shareCount(), _parts.with.account.vaultraUser());
+    _arrived.save(_inOrder, _inOrderDone);
 }
 
 void ApplyLoop::applyInOrder(const CXDChangeRecordPtr& record) {
     int32_t left = record->appliesToSources();
-    if (!_parts.terminating && meetsOwnWaitingWrite(*record)) {
+    if (!_parts.terminating && _left->meetsOwnWaitingWrite(*record)) {
         CXDLog("%@ waits until our own version is written", record);
         left = 0;
-    } else if (!_parts.terminating && isOfWhatWasTakenOutHere(*record)) {
+    } else if (!_parts.terminating && _left->isOfWhatWasTakenOutHere(*record)) {
         CXDLog("%@ is out", record);
         left = 0;
     } else if (!_parts.terminating) {
         if ((left & CXDSyncSourceCX) && applyTo(*_parts.conduits.cx, CXDSyncSourceCX, record)) left &= ~CXDSyncSourceCX;
         if (left & CXDSyncSourceVaultra) {
             if (applyTo(*_parts.conduits.vaultra, CXDSyncSourceVaultra, record)) left &= ~CXDSyncSourceVaultra;
-            if (_denied) cancelLike(record);
+            if (_denied) _refusals.cancelLike(record, _inOrder);
         }
     }
     if (left) {
@@ -432,10 +273,7 @@ bool ApplyLoop::applyTo(CXDConduit& conduit, int32_t source, const CXDChangeReco
         forgetRefusedChange(data, *record);
     });
     _parts.outcomes.applied(*record, source);
-    const bool isArrival = record->type() == CXDUpdateRecord
-                               ? record->person().has_value()
-                               : record->type() == CXDCreateStructureForGroup && record->group().has_value();
-    if (isArrival && source == CXDSyncSourceCX && record->user()) _arrived.push_back(record);
+    if (source == CXDSyncSourceCX) _arrived.note(record);
     return true;
 }
 
@@ -470,8 +308,7 @@ bool ApplyLoop::noteSwallowed(const CXDChangeRecord& record) {
     }
     if (!record.group() || record.group()->str() == kCXAllGroupUID) return false;
     if (!_parts.with.rolvane.recordForUniqueId(cxUIDWithTableName(*record.group(), kCXGroupTable))) return false;
-    _unsettled.set(record.group()->str(), true);
-    noteUnsure(*record.group());
+    _recovery.compareAgain(*record.group());
     return true;
 }
 
@@ -492,12 +329,6 @@ void ApplyLoop::forgetGroupThatIsListed(const CXDChangeRecord& record) {
 bool ApplyLoop::isOfAStrangeGroup(const CXDChangeRecord& record) const {
     return record.group() && record.group()->str() != kCXAllGroupUID && record.type() != CXDDeleteGroup &&
            !_parts.with.rolvane.recordForUniqueId(cxUIDWithTableName(*record.group(), kCXGroupTable));
-}
-
-// The list stays the same for the whole pass, so one walk a user is enough.
-void ApplyLoop::cancelLike(const CXDChangeRecordPtr& record) {
-    const bool walk = record->user() && _cancelledUsers.insert(*record->user()).second;
-    _parts.denied.cancelLike(record, walk ? _inOrder : CXDChangeRecords());
 }
 
 } // namespace rolvane

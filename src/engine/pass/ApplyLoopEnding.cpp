@@ -2,19 +2,12 @@
 
 #include "contacts/database/CXRolvane.h"
 #include "contacts/database/DamagedDatabase.h"
-#include "contacts/records/Identifier.h"
 #include "engine/memory/PassCommit.h"
-#include "engine/memory/PublicationCache.h"
 #include "engine/pass/ApplyLoop.h"
 #include "engine/pass/OutOfOrderWork.h"
-#include "engine/queue/RefusedChanges.h"
-#include "engine/recovery/Holdings.h"
 #include "engine/recovery/UnderWay.h"
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
-#include "foundation/TestSwitch.h"
-#include "model/PayloadKeys.h"
-#include "model/RemoteLocationMap.h"
 
 #include <algorithm>
 #include <iterator>
@@ -86,17 +79,15 @@ void ApplyLoop::storeQueue(bool allowRetry) {
     CXDLog("Pending: %@", _pendingChanges);
     CXDLog("Denied:  %@", _parts.denied.all());
     _parts.outcomes.leaves(_pendingChanges);
-    noteRefused();
-    for (const CXDChangeRecordPtr& record : _parts.denied.all()) takeBack(*record);
+    _refusals.note();
+    _refusals.takeBack();
     _parts.state.setPendingChanges(_pendingChanges);
-    _end.unsureGroups.merge(groupsOf(ownWrites(_pendingChanges)));
-    _end.everythingIsPublished = isPublished(*_parts.with.rolvane.allGroup());
     const bool nothingWaits =
         std::all_of(_pendingChanges.begin(), _pendingChanges.end(),
                     [](const CXDChangeRecordPtr& record) { return waitsForTheSharedFolderAlone(*record); });
-    const bool lookAgain = noteUnsettled() && nothingWaits;
+    const bool lookAgain = _recovery.end(_pendingChanges) && nothingWaits;
     _pendingChanges.clear();
-    tellRefused();
+    _refusals.tell();
     if (!_parts.denied.empty() || lookAgain) {
         _parts.denied.clear();
         if (allowRetry) _actions.scheduleRetry();
@@ -114,52 +105,6 @@ void ApplyLoop::closeConduits() {
     }
 }
 
-void ApplyLoop::tellRefused() {
-    const Date now = _parts.with.clock.now();
-    std::vector<Refusal> refused = _parts.state.takeRefused();
-    bool ofOwn = false;
-    for (const CXDChangeRecordPtr& record : _parts.denied.all())
-        if (isOwnWrite(*record))
-            ofOwn = true;
-        else
-            refused.push_back({record->user().value_or(UserName())});
-    if (!refused.empty()) _parts.state.noteRefusedChanges(refused, now);
-    size_t waiting = 0;
-    _parts.state.withConduitData([&](Dictionary& data) {
-        if (!ofOwn) settleRefusedChanges(data, now);
-        if (hasRefusedChanges(data)) waiting = countRefusedChanges(data);
-    });
-    _parts.outcomes.rests(kSelf, static_cast<int64_t>(waiting));
-    _parts.state.noteRefusedByOwnStore(waiting, ofOwn ? std::optional(now) : std::nullopt);
-}
-
-// What another user's store has refused is undone in the copy: contacts are read again, and a group counts as changed
-// there, so that the next comparison finds the store without the change.
-void ApplyLoop::takeBack(const CXDChangeRecord& record) {
-    if (isLeftOut("taking back")) return;
-    if (record.initialSource() != CXDSyncSourceCX || record.changeMadeByDataOwner() || !record.user()) return;
-    _parts.conduits.vaultra->wasRefused(record);
-    if (!record.group()) return;
-    _parts.state.withConduitData([&](Dictionary& data) {
-        const Dictionary groups =
-            data[kConduitVaultra].dictionary()[kPriorState].dictionary()[record.user()->str()].dictionary();
-        if (groups.contains(cxUIDWithTableName(*record.group(), kCXGroupTable).str()))
-            updateCache(data, CXDSyncSourceVaultra, record);
-    });
-}
-
-void ApplyLoop::noteUnsure(const UniqueId& group) {
-    if (isLeftOut("unsure groups")) return;
-    _end.unsureGroups.insert(cxUIDWithTableName(group, kCXGroupTable));
-}
-
-// The next scan takes them from there. False when there are none.
-bool ApplyLoop::noteUnsettled() {
-    if (_unsettled.empty() || isLeftOut("unsettled groups")) return false;
-    _parts.state.conduitObjectForKey(kConduitCX, kUnsettledGroups).addEntriesFrom(_unsettled);
-    return true;
-}
-
 void ApplyLoop::bumpShareCount() {
     CXRolvane& rolvane = _parts.with.rolvane;
     Preferences& preferences = _parts.with.preferences;
@@ -169,9 +114,7 @@ void ApplyLoop::bumpShareCount() {
     rolvane.save();
     const std::optional<UserName> user = _parts.with.account.vaultraUser();
     preferences.set(kDaemonDomain, kCXDLastOstrelUser, user ? Value(*user) : Value());
-    if (_underWay)
-        _parts.state.setUnderWay(isLeftOut("adrift") ? Dictionary()
-                                                     : adrift(*_underWay, _parts.state.conduitData(), _end));
+    _recovery.storeNote();
     _parts.state.putConduitData();
     if (preferences.get(kDaemonDomain, kCXDKnownDatabase) != Value(rolvane.databaseIdentity()))
         preferences.set(kDaemonDomain, kCXDKnownDatabase, rolvane.databaseIdentity());

@@ -11,9 +11,10 @@ namespace rolvane {
 class CXDConduit;
 class CXRolvane;
 
-// A change that waited for a store says what was true when it was made. Before a pass applies it, it is restated as what
-// the database says of its subject now, so the order in which changes waited does not matter:
-// - The content of a contact that has left the database becomes its removal. So does the change of such a group. Nothing
+// A change that waited for a store says what was true when it was made. Before a pass applies it, it is restated as
+// what the database says of its subject now, so the order in which changes waited does not matter:
+// - The content of a contact that has left the database becomes its removal. So does the change of such a group.
+// Nothing
 //   that is known of the store would ever take away what such a change puts there, or has put there before its answer
 //   was lost. Whoever was to be put into a group is taken out of it and removed.
 // - The removal of a contact or of a group that is in the database again is dropped: an undone deletion, an imported
@@ -25,7 +26,8 @@ struct Restatement {
     std::function<bool(const UserName& user)> hasCopies; // is the user's tree the one that the copies here came from?
 
     // `records`: the pass's input, `fresh` new ones and then the queue, which alone is looked at, and of it the changes
-    // in trees whose copies are here. Main thread. Throws CXDamagedDatabase, and `records` may then be restated in part.
+    // in trees whose copies are here. Main thread. Throws CXDamagedDatabase, and `records` may then be restated in
+    // part.
     void restate(CXDChangeRecords& records, size_t fresh) const;
     // The same but for the comparison of groups.
     void withdrawWhatIsGone(CXDChangeRecords& records, size_t fresh) const;
