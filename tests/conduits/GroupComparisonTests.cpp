@@ -130,7 +130,7 @@ TEST(GroupComparison, ARenamedGroupCarriesItsNewName) {
 }
 
 TEST(GroupComparison, ANameThatTheDatabaseGaveToAGroupWithoutOneIsNobodysEdit) {
-    const Dictionary nameless{{kMemberUIDState, Array()}, {kSubgroupUIDState, Array()}};
+    const Dictionary nameless{{"memberUIDState", Array()}, {"subgroupUIDState", Array()}};
     const Dictionary given = state({}, "untitled group");
     EXPECT_EQ(steps(nameless, given, kOwners), Texts{});
     EXPECT_EQ(steps(nameless, state({}, "Friends"), kOwners), Texts{"4 <self> - G:CXGroup 4"});

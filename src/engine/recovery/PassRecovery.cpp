@@ -15,7 +15,8 @@ namespace rolvane {
 void PassRecovery::begin(CXDChangeRecords& records, size_t fresh) {
     // Of a pass that was killed, or what an earlier one left adrift.
     _underWay = underWayInAnyForm(_parts.state.underWay());
-    restatement().restate(records, fresh);
+    const CXDChangeRecords before = restatement().restate(records, fresh);
+    _underWay = underWayTogether(*_underWay, withSubscriptions(listsUnderWay(before)));
     settle(records);
 }
 

@@ -10,6 +10,7 @@
 #include "model/PayloadKeys.h"
 
 #include <algorithm>
+#include <functional>
 #include <iterator>
 #include <set>
 #include <utility>
@@ -96,7 +97,7 @@ void Restatement::dropRemovalsOfWhatIsBack(CXDChangeRecords& records, size_t fre
     records.erase(std::remove_if(queue, records.end(), isBack), records.end());
 }
 
-void Restatement::compareGroups(CXDChangeRecords& records, size_t fresh) const {
+CXDChangeRecords Restatement::compareGroups(CXDChangeRecords& records, size_t fresh) const {
     std::set<std::pair<UserName, UniqueId>> groups;
     for (size_t i = fresh; i < records.size(); ++i)
         if (isOfGroup(*records[i]) && hasCopies(*records[i]->user()))
@@ -113,15 +114,18 @@ void Restatement::compareGroups(CXDChangeRecords& records, size_t fresh) const {
         return isOfGroup(*record) &&
                groups.contains({*record->user(), cxUIDWithTableName(*record->group(), kCXGroupTable)});
     };
-    records.erase(std::remove_if(queue, records.end(), isRestated), records.end());
+    const auto restated = std::stable_partition(queue, records.end(), std::not_fn(isRestated));
+    CXDChangeRecords before(std::make_move_iterator(restated), std::make_move_iterator(records.end()));
+    records.erase(restated, records.end());
     std::move(now.begin(), now.end(), std::back_inserter(records));
+    return before;
 }
 
-void Restatement::restate(CXDChangeRecords& records, size_t fresh) const {
-    if (records.size() <= fresh) return;
+CXDChangeRecords Restatement::restate(CXDChangeRecords& records, size_t fresh) const {
+    if (records.size() <= fresh) return {};
     withdrawWhatIsGone(records, fresh);
     dropRemovalsOfWhatIsBack(records, fresh);
-    compareGroups(records, fresh);
+    return compareGroups(records, fresh);
 }
 
 } // namespace rolvane

@@ -12,29 +12,28 @@ class CXDConduit;
 class CXRolvane;
 
 // A change that waited for a store says what was true when it was made. Before a pass applies it, it is restated as
-// what the database says of its subject now, so the order in which changes waited does not matter:
-// - The content of a contact that has left the database becomes its removal. So does the change of such a group.
-// Nothing
-//   that is known of the store would ever take away what such a change puts there, or has put there before its answer
-//   was lost. Whoever was to be put into a group is taken out of it and removed.
-// - The removal of a contact or of a group that is in the database again is dropped: an undone deletion, an imported
-//   card.
-// - All other changes of a group give way to one comparison of the group with what is known of its store.
+// what the database says of its subject now, so the order in which changes waited does not matter.
+//
+// Content of a contact that has left the database becomes the contact's removal, and any change of such a group the
+// group's: nothing that is known of the store would ever take away what such a change puts there, or has put there
+// before its answer was lost. Whoever was to be put into a group is taken out of it and removed. The removal of a
+// contact or group that is in the database again (an undone deletion, an imported card) is dropped. All other changes
+// of a group give way to one comparison of the group with what is known of its store.
 struct Restatement {
     CXRolvane& rolvane;
     CXDConduit& database;                                // the contact database's
     std::function<bool(const UserName& user)> hasCopies; // is the user's tree the one that the copies here came from?
 
     // `records`: the pass's input, `fresh` new ones and then the queue, which alone is looked at, and of it the changes
-    // in trees whose copies are here. Main thread. Throws CXDamagedDatabase, and `records` may then be restated in
-    // part.
-    void restate(CXDChangeRecords& records, size_t fresh) const;
+    // in trees whose copies are here. Gives the changes of groups that gave way: some of them may be on the store,
+    // their answers lost. Main thread. Throws CXDamagedDatabase, and `records` may then be restated in part.
+    CXDChangeRecords restate(CXDChangeRecords& records, size_t fresh) const;
     // The same but for the comparison of groups.
     void withdrawWhatIsGone(CXDChangeRecords& records, size_t fresh) const;
     void dropRemovalsOfWhatIsBack(CXDChangeRecords& records, size_t fresh) const;
 
 private:
-    void compareGroups(CXDChangeRecords& records, size_t fresh) const;
+    CXDChangeRecords compareGroups(CXDChangeRecords& records, size_t fresh) const;
 };
 
 } // namespace rolvane
