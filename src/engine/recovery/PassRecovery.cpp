@@ -16,7 +16,8 @@ void PassRecovery::begin(CXDChangeRecords& records, size_t fresh) {
     // Of a pass that was killed, or what an earlier one left adrift.
     _underWay = underWayInAnyForm(_parts.state.underWay());
     const CXDChangeRecords before = restatement().restate(records, fresh);
-    _underWay = underWayTogether(*_underWay, withSubscriptions(listsUnderWay(before)));
+    if (!isLeftOut("restated under way"))
+        _underWay = underWayTogether(*_underWay, withSubscriptions(listsUnderWay(before)));
     settle(records);
 }
 

@@ -98,6 +98,7 @@ void Restatement::dropRemovalsOfWhatIsBack(CXDChangeRecords& records, size_t fre
 }
 
 CXDChangeRecords Restatement::compareGroups(CXDChangeRecords& records, size_t fresh) const {
+    if (isLeftOut("restated groups")) return {};
     std::set<std::pair<UserName, UniqueId>> groups;
     for (size_t i = fresh; i < records.size(); ++i)
         if (isOfGroup(*records[i]) && hasCopies(*records[i]->user()))
