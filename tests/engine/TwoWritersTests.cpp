@@ -363,7 +363,8 @@ TEST_F(TwoWriters, AContactThatIsNowhereAndThatAWriterHasListedIsNamedNoLonger) 
         return stateOf(UniqueId(kCXAllGroupUID))["memberUIDState"].array().containsString(gone.str());
     };
     ASSERT_TRUE(listed()) << log.text();
-    for (int round = 0; round < 3; ++round) alice.pass(); // Bob's daemon, which knows that it was he, would take it back
+    for (int round = 0; round < 3; ++round)
+        alice.pass(); // Bob's daemon, which knows that it was he, would take it back
     EXPECT_TRUE(listed()) << "the contact may be on its way\n" << log.text();
     alice.clock.ahead = kPatience + 1;
     alice.pass();
