@@ -9,6 +9,7 @@
 #include "support/WaitUntil.h"
 
 #include <filesystem>
+#include <future>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -226,6 +227,20 @@ TEST_F(Inviting, OneLineSetsEverythingUpAndWorksOnce) {
     EXPECT_EQ(elsewhere("bob", "account test").status, kNotAllowed);
     EXPECT_EQ(elsewhere("bob", "setup " + quotedForShell(second) + " --no-input").status, kDone);
     EXPECT_EQ(elsewhere("bob", "account test").status, kDone);
+}
+
+// Somebody else has read the line and uses it at the same moment: one of both has the account, and the other is told.
+TEST_F(Inviting, OfTwoWhoUseALineAtOnceOneHasTheAccount) {
+    const std::string command = "setup " + quotedForShell(invited("bob")) + " --no-input";
+    auto thief = std::async(std::launch::async, [&] { return elsewhere("thief", command); });
+    const Ran bob = elsewhere("bob", command), other = thief.get();
+    ASSERT_NE(bob.status == kDone, other.status == kDone) << bob << other;
+    const char* const loser = bob.status == kDone ? "thief" : "bob";
+    const char* const winner = bob.status == kDone ? "bob" : "thief";
+    EXPECT_EQ(elsewhere(winner, "account test").status, kDone);
+    EXPECT_NE(elsewhere(loser, "account test").status, kDone);
+    EXPECT_TRUE(saysOnce(elsewhere(loser, command), kNotAllowed, "the line works once"));
+    EXPECT_EQ(elsewhere(winner, "account test").status, kDone);
 }
 
 TEST_F(Inviting, ALineThatNamesAnotherAuthoritySendsNoPassword) {
