@@ -184,6 +184,8 @@ Written CardWriter::putPerson(const ClientCard& card, const std::optional<Member
     if (person) {
         const Dictionary before = person->dictionaryRepresentation();
         expected.push_back({person->uniqueId(), person->valueForProperty(kCXModificationDateProperty).date()});
+        // Another program has saved since the memory was brought up to date: the client has not had what it saved.
+        if (now && expected.back().modified != now->modified) throw changedMeanwhile();
         Devices devices(_memory);
         const auto merge = mergedCard(person->uniqueId(), hadBy(now, before), before, card,
                                       [&](const std::string& property) { return devices.knows(_c.device, property); });
@@ -234,6 +236,7 @@ Written CardWriter::putGroup(const ClientCard& card, const std::optional<Member>
     if (group) {
         before = groupEntity(_rolvane, *group);
         expected.push_back({group->uniqueId(), group->valueForProperty(kCXModificationDateProperty).date()});
+        if (now && expected.back().modified != now->modified) throw changedMeanwhile(); // as of a person
         mayRemove = mayRemove || Devices(_memory).had(_c.device, _c.book.id, *now).isPresent;
     } else {
         group =
