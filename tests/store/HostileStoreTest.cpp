@@ -113,6 +113,18 @@ TEST(HostileStore, WritesNothingToTheStandardErrorOfItsReader) {
     EXPECT_EQ(testing::internal::GetCapturedStderr(), "");
 }
 
+TEST(HostileStore, OnlyEncodingsThatXMLReadersShareAreRead) {
+    const auto isRead = [](const std::string& encoding, const char* text) {
+        return parseDAVTree("<?xml version=\"1.0\" encoding=\"" + encoding + "\"?><D:x xmlns:D=\"DAV:\">" + text +
+                            "</D:x>")
+            .has_value();
+    };
+    for (const char* each : {"utf-8", "UTF-8", "iso-8859-1", "us-ascii"}) EXPECT_TRUE(isRead(each, "a")) << each;
+    EXPECT_TRUE(isRead("ISO-8859-1", "\xe4"));
+    for (const char* each : {"utf08", "koi8-r", "windows-1251", "shift_jis", "utf-7"})
+        EXPECT_FALSE(isRead(each, "a")) << each;
+}
+
 TEST(HostileStore, AServerOfAnotherClassIsNotAWebDAVServer) {
     CXDAVError error;
     const auto isOne = [&](const char* dav) {

@@ -47,6 +47,22 @@ std::string plainURI(std::string_view uri) {
     return out;
 }
 
+// Bodies are UTF-8 or UTF-16 (XML 1.0 section 4.3.3 asks for both); some servers write plain ASCII or Latin-1. The
+// system's converters know some hundred more names, and what they make of damaged bytes depends on the pieces in which
+// these come.
+bool isReadable(const xmlParserCtxt& context) {
+    const xmlChar* declared = context.input ? context.input->encoding : nullptr;
+    if (!declared) return true;
+    switch (xmlParseCharEncoding(reinterpret_cast<const char*>(declared))) {
+    case XML_CHAR_ENCODING_UTF8:
+    case XML_CHAR_ENCODING_UTF16LE:
+    case XML_CHAR_ENCODING_UTF16BE:
+    case XML_CHAR_ENCODING_8859_1:
+    case XML_CHAR_ENCODING_ASCII: return true;
+    default: return false;
+    }
+}
+
 } // namespace
 
 XmlSax::XmlSax(int maxDepth) : _maxDepth(static_cast<size_t>(maxDepth)) {
@@ -101,6 +117,7 @@ void XmlSax::onStart(void* self, const xmlChar* local, const xmlChar* prefix, co
                      int, int, const xmlChar**) {
     auto* sax = static_cast<XmlSax*>(self);
     if (!sax->_good) return;
+    if (sax->_path.empty() && !isReadable(*sax->_context)) return sax->refuse();
     const std::string_view space = uri ? reinterpret_cast<const char*>(uri) : "";
     std::string name = reinterpret_cast<const char*>(local);
     // A name with a prefix that nobody declared, or with half of one, belongs nowhere.

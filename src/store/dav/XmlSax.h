@@ -7,9 +7,10 @@
 
 namespace rolvane {
 
-// A namespace-aware push parser over libxml2's SAX2 interface. A declaration within a document type, text that is not
-// UTF-8 (RFC 3629) once it was decoded, a reference to an entity that XML does not define, depth over the limit or a
-// false from a handler ends it. Base of the readers of WebDAV bodies; one thread.
+// A namespace-aware push parser over libxml2's SAX2 interface. A declaration within a document type, another encoding
+// than UTF-8, UTF-16, ISO-8859-1 or ASCII, text that is not UTF-8 (RFC 3629) once it was decoded, a reference to an
+// entity that XML does not define, depth over the limit or a false from a handler ends it. Base of the readers of
+// WebDAV bodies; one thread.
 class XmlSax {
 public:
     explicit XmlSax(int maxDepth);
