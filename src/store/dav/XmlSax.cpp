@@ -52,7 +52,7 @@ std::string plainURI(std::string_view uri) {
 // these come.
 bool isReadable(const xmlParserCtxt& context) {
     const xmlChar* declared = context.input ? context.input->encoding : nullptr;
-    if (!declared) return true;
+    if (!declared || xmlStrcasecmp(declared, BAD_CAST "us-ascii") == 0) return true;
     switch (xmlParseCharEncoding(reinterpret_cast<const char*>(declared))) {
     case XML_CHAR_ENCODING_UTF8:
     case XML_CHAR_ENCODING_UTF16LE:
