@@ -109,8 +109,8 @@ public:
         return applyChangeRecordIfNeeded(record, nullptr);
     }
 
-    // What of a user's group the stores do not have yet, and with it the contents of new members. None: this source
-    // cannot tell. Base: none.
+    // The changes of a user's group that its store does not have yet, and with them the contents of new members. None:
+    // this source cannot tell. Base: none.
     virtual std::optional<CXDChangeRecords> changesOfGroupNow(const UserName& /*user*/, const UniqueId& /*group*/) {
         return std::nullopt;
     }

@@ -39,7 +39,7 @@ private:
 
     CXDAVManager& _store;
     const int _event;               // readable: the thread is done
-    std::set<std::string> _useless; // trees of which nothing could be kept
+    std::set<std::string> _useless; // trees whose listings could not be kept
     std::function<void()> _done;
     std::thread _thread;
     std::mutex _mutex;

@@ -45,8 +45,8 @@ void endPass(EngineParts& parts);
 // out, exit status 0. From another thread than the main one the run loop is left alone.
 [[noreturn]] void killCXD(EngineParts& parts);
 
-// What is remembered counts for this database and account. A first pass says so long before it ends: killed behind its
-// first save, it would be a first pass again, for which nothing of what is there came from a store.
+// The memory counts for this database and account from now on. A first pass says so long before it ends: killed behind
+// its first save, it would be a first pass again, for which no contact here came from a store.
 void claimState(EngineParts& parts);
 // checkCXShareCount: forgets everything when the database is not the one of the last pass, or the account is another.
 void checkCXShareCount(EngineParts& parts);

@@ -36,7 +36,7 @@ public:
 
     // The end. `left`: the queue. Gives whether the next scan has a group to compare.
     bool end(const CXDChangeRecords& left);
-    void storeNote(); // of what stays under way; without synchronising
+    void storeNote(); // of writes that stay under way; without synchronising
 
 private:
     void settle(CXDChangeRecords& records);

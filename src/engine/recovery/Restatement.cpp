@@ -55,7 +55,7 @@ void withdrawMembers(const CXDChangeRecord& composite, Holdings& holdings, CXDCh
         }
 }
 
-// A change of what a group is or holds, for its store alone; its deletion is none.
+// A change of a group's name, members, rights or choices, for its store alone; its deletion is none.
 bool isOfGroup(const CXDChangeRecord& record) {
     return record.initialSource() == CXDSyncSourceCX && record.appliesToSources() == CXDSyncSourceVaultra &&
            record.user() && record.group() && *record.group() != kPeopleGroup && record.type() != CXDDeleteGroup;
