@@ -4,6 +4,7 @@
 #include "contacts/records/Identifier.h"
 #include "engine/memory/PassCommit.h"
 #include "engine/recovery/Holdings.h"
+#include "engine/recovery/UnsettledGroups.h"
 #include "foundation/TestSwitch.h"
 #include "model/PayloadKeys.h"
 #include "model/RemoteLocationMap.h"
@@ -12,9 +13,26 @@
 
 namespace rolvane {
 
+namespace {
+
+// Groups in other users' trees: their waiting changes are sent as they are, and the next scan compares the groups.
+Dictionary unsettledOfOthers(const CXDChangeRecords& records, size_t fresh) {
+    CXDChangeRecords others;
+    size_t freshOthers = 0;
+    for (size_t i = 0; i < records.size(); ++i)
+        if (records[i]->user() != kSelf) {
+            others.push_back(records[i]);
+            if (i < fresh) ++freshOthers;
+        }
+    return unsettledGroups(others, freshOthers);
+}
+
+} // namespace
+
 void PassRecovery::begin(CXDChangeRecords& records, size_t fresh) {
     // Of a pass that was killed, or what an earlier one left adrift.
     _underWay = underWayInAnyForm(_parts.state.underWay());
+    _unsettled = unsettledOfOthers(records, fresh);
     const CXDChangeRecords before = restatement().restate(records, fresh);
     if (!isLeftOut("restated under way"))
         _underWay = underWayTogether(*_underWay, withSubscriptions(listsUnderWay(before)));

@@ -55,10 +55,12 @@ void withdrawMembers(const CXDChangeRecord& composite, Holdings& holdings, CXDCh
         }
 }
 
-// A change of a group's name, members, rights or choices, for its store alone; its deletion is none.
+// A change of a group's name, members, rights or choices, for the owner's store alone; its deletion is none. Copies of
+// somebody else's contacts may be older than their publisher's store, and are not compared for it.
 bool isOfGroup(const CXDChangeRecord& record) {
     return record.initialSource() == CXDSyncSourceCX && record.appliesToSources() == CXDSyncSourceVaultra &&
-           record.user() && record.group() && *record.group() != kPeopleGroup && record.type() != CXDDeleteGroup;
+           record.user() == kSelf && record.group() && *record.group() != kPeopleGroup &&
+           record.type() != CXDDeleteGroup;
 }
 
 } // namespace
@@ -101,7 +103,7 @@ CXDChangeRecords Restatement::compareGroups(CXDChangeRecords& records, size_t fr
     if (isLeftOut("restated groups")) return {};
     std::set<std::pair<UserName, UniqueId>> groups;
     for (size_t i = fresh; i < records.size(); ++i)
-        if (isOfGroup(*records[i]) && hasCopies(*records[i]->user()))
+        if (isOfGroup(*records[i]))
             groups.emplace(*records[i]->user(), cxUIDWithTableName(*records[i]->group(), kCXGroupTable));
     CXDChangeRecords now;
     std::erase_if(groups, [&](const auto& of) {

@@ -18,7 +18,7 @@ class CXRolvane;
 // group's: nothing that is known of the store would ever take away what such a change puts there, or has put there
 // before its answer was lost. Whoever was to be put into a group is taken out of it and removed. The removal of a
 // contact or group that is in the database again (an undone deletion, an imported card) is dropped. All other changes
-// of a group give way to one comparison of the group with what is known of its store.
+// of an own group give way to one comparison of the group with what is known of its store.
 struct Restatement {
     CXRolvane& rolvane;
     CXDConduit& database;                                // the contact database's
