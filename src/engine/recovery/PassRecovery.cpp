@@ -34,8 +34,7 @@ void PassRecovery::begin(CXDChangeRecords& records, size_t fresh) {
     _underWay = underWayInAnyForm(_parts.state.underWay());
     _unsettled = unsettledOfOthers(records, fresh);
     const CXDChangeRecords before = restatement().restate(records, fresh);
-    if (!isLeftOut("restated under way"))
-        _underWay = underWayTogether(*_underWay, withSubscriptions(listsUnderWay(before)));
+    _underWay = underWayTogether(*_underWay, withSubscriptions(listsUnderWay(before)));
     settle(records);
 }
 
