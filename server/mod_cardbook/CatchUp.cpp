@@ -45,6 +45,8 @@ public:
         }
         for (const UniqueId& uid : records) settle(uid);
         for (const UniqueId& uid : groups) settleGroup(uid);
+        if (_mayDateOtherGroups)
+            for (const CXListing& line : _rolvane.listGroups(std::nullopt)) settle(line.uniqueId);
         return true;
     }
 
@@ -133,9 +135,11 @@ private:
         for (const std::string& book : _memory.booksWith(uid)) {
             if (std::find(now.books.begin(), now.books.end(), book) != now.books.end()) continue;
             _memory.noteGone(book, uid);
-            // A removal dates the groups that it takes somebody out of, without a line in the journal for them.
+            // A removal dates the groups that it takes somebody out of, without a line in the journal for them. Books
+            // tell the groups of an own person alone.
             if (book.starts_with(kGroupBook))
                 settle(UniqueId(book.substr(kGroupBook.size()) + ":" + std::string(kCXGroupTable)));
+            _mayDateOtherGroups |= cxIsSubscribed(uid) || cxTableName(uid).ends_with("Group");
         }
     }
 
@@ -169,6 +173,7 @@ private:
     CXRolvane& _rolvane;
     BookMemory& _memory;
     std::optional<std::map<std::string, std::string>> _shared;
+    bool _mayDateOtherGroups = false;
 };
 
 } // namespace

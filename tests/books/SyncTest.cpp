@@ -82,6 +82,23 @@ TEST(Sync, TellsExactlyWhatChangedWhoeverDidIt) {
     EXPECT_EQ(client.tags, client.served());
 }
 
+// The removal of a listed group has no line in the journal for the groups that list it.
+TEST(Sync, TellsOfAGroupThatHasLostASubgroup) {
+    BooksWorld world;
+    const auto ann = world.addPerson("Ann", "Lee");
+    const auto inner = world.addGroup("Inner", {ann}), outer = world.addGroup("Outer", {ann});
+    ASSERT_TRUE(outer->addSubgroup(inner));
+    world.rolvane().save();
+    Client client{world};
+    EXPECT_EQ(client.sync(), 3u);
+    world.rolvane().removeRecord(inner);
+    world.rolvane().save();
+    EXPECT_EQ(client.sync(), 2u) << "the group that has gone, and the one that listed it";
+    EXPECT_EQ(client.tags, client.served());
+    const auto card = world.ask("GET", hrefOf(outer));
+    EXPECT_EQ(world.put(hrefOf(outer), card.body, {{"If-Match", card.tag()}}).status, 204);
+}
+
 TEST(Sync, GoesOnWhereItWasCutOff) {
     BooksWorld world;
     std::vector<CXPersonRef> people;
