@@ -8,7 +8,7 @@
 namespace rolvane::cardbook {
 namespace {
 
-constexpr int kFormat = 2; // 1 had no table joined
+constexpr int kFormat = 3; // 1 had no table joined; in 2, looks were noted of devices that had been told of tags alone
 constexpr const char* kTables = R"(
 CREATE TABLE meta(key TEXT PRIMARY KEY, value) WITHOUT ROWID;
 CREATE TABLE books(id INTEGER PRIMARY KEY, book TEXT NOT NULL UNIQUE, seq INTEGER NOT NULL, begun INTEGER NOT NULL,
@@ -53,10 +53,11 @@ BookMemory::BookMemory(const std::string& path, int busyTimeoutMilliseconds, int
     if (format < 0 || format > kFormat)
         throw CXException(kCXDatabaseException, path + " was written by a newer version of this program.");
     if (format == kFormat) return; // another process was faster
-    _sqlite.execute(kJoinedTable);
+    if (format < 2) _sqlite.execute(kJoinedTable);
     _sqlite.execute("PRAGMA user_version=" + std::to_string(kFormat));
-    if (format == 1) { // everybody is looked at once more
-        _sqlite.execute("DELETE FROM meta WHERE key='position'");
+    if (format > 0) {
+        if (format == 1) _sqlite.execute("DELETE FROM meta WHERE key='position'"); // everybody is looked at once more
+        _sqlite.execute("DELETE FROM looks");
         transaction.commit();
         return;
     }

@@ -19,8 +19,14 @@
 namespace rolvane::cardbook {
 namespace {
 
+constexpr int kRounds = 100; // against other programs, each of which has saved the same card in the same moment
+
 Refused changedMeanwhile() {
     return {412, "The card has changed meanwhile."};
+}
+
+CXException savedAgainAndAgain() {
+    return {kCXDatabaseException, "Other programs kept it locked by saving the same card again and again."};
 }
 
 Refused notHere(const std::string& words) {
@@ -54,14 +60,13 @@ private:
 CardWriter::CardWriter(Library& library, WriteContext context)
     : _library(library), _rolvane(library.rolvane()), _memory(library.memory()), _c(std::move(context)) {}
 
-// The card of the name now. It must be what the conditions were judged against.
+// The card of the name now, for which the conditions hold.
 std::optional<Member> CardWriter::settle() {
     _library.catchUp();
     const auto now = _memory.named(_c.book.id, _c.name);
-    if (_c.isConditional) {
-        const bool isSame = now && _c.judged && now->uid == _c.judged->uid && now->modified == _c.judged->modified;
-        if (!isSame && (now || _c.judged)) throw changedMeanwhile();
-    }
+    const bool isSame = now && _c.judged && now->uid == _c.judged->uid && now->modified == _c.judged->modified;
+    const bool isNeither = !now && !_c.judged;
+    if (!isSame && !isNeither && !_c.conditions.holdAgain(now.has_value())) throw changedMeanwhile();
     return now;
 }
 
@@ -79,14 +84,17 @@ void CardWriter::wish(const Book& book, const UniqueId& uid, const std::string& 
     change.commit();
 }
 
-void CardWriter::save(const std::vector<CXExpected>& expected) {
+bool CardWriter::saveIfStill(const std::vector<CXExpected>& expected) {
+    bool isSaved = false;
     try {
-        if (!_rolvane.saveIfStill(expected)) throw changedMeanwhile();
+        isSaved = _rolvane.saveIfStill(expected);
     } catch (const std::exception&) {
         _rolvane.rollback();
         throw;
     }
+    if (!isSaved) _rolvane.rollback();
     _library.catchUp();
+    return isSaved;
 }
 
 // The date that the save since then gave the record: another program may have saved it again before the memory took
@@ -153,16 +161,20 @@ Written CardWriter::put(const std::string& text) {
     if (card.entity.isGroup && _c.book.kind != Book::Kind::contacts)
         throw notHere("Cards of groups are written in \"Contacts\".");
     const Turn turn(bookMemoryPath(_rolvane.path()) + ".lock");
-    const auto now = settle();
-    Written written = card.entity.isGroup ? putGroup(card, now) : putPerson(card, now);
-    Devices(_memory).noteKnowledge(_c.device, knowledgeOf(card));
-    return written;
+    for (int round = 0; round < kRounds; ++round) {
+        const auto now = settle();
+        const auto written = card.entity.isGroup ? putGroup(card, now) : putPerson(card, now);
+        if (!written) continue;
+        Devices(_memory).noteKnowledge(_c.device, knowledgeOf(card));
+        return *written;
+    }
+    throw savedAgainAndAgain();
 }
 
 // The version that the client wrote over, as far as it is known.
 std::optional<Dictionary> CardWriter::hadBy(const std::optional<Member>& now, const Dictionary& properties) {
     if (!now) return std::nullopt; // by another name, or in another book: nothing is known to be common
-    if (_c.isConditional) return properties;
+    if (_c.conditions.namesTag) return properties;
     const Devices::Had had = Devices(_memory).had(_c.device, _c.book.id, *now);
     if (had.isPresent) return properties;
     const auto former = had.then ? _rolvane.formerVersion(now->uid, *had.then) : nullptr;
@@ -177,7 +189,7 @@ void CardWriter::apply(const CXPersonRef& person, const Dictionary& before, cons
         if (!after.contains(name)) person->removeValueForProperty(name);
 }
 
-Written CardWriter::putPerson(const ClientCard& card, const std::optional<Member>& now) {
+std::optional<Written> CardWriter::putPerson(const ClientCard& card, const std::optional<Member>& now) {
     auto person = std::dynamic_pointer_cast<CXPerson>(target(card, now));
     const bool isShared = _c.book.kind == Book::Kind::shared;
     std::vector<CXExpected> expected;
@@ -185,7 +197,7 @@ Written CardWriter::putPerson(const ClientCard& card, const std::optional<Member
         const Dictionary before = person->dictionaryRepresentation();
         expected.push_back({person->uniqueId(), person->valueForProperty(kCXModificationDateProperty).date()});
         // Another program has saved since the memory was brought up to date: the client has not had what it saved.
-        if (now && expected.back().modified != now->modified) throw changedMeanwhile();
+        if (now && expected.back().modified != now->modified) return std::nullopt;
         Devices devices(_memory);
         const auto merge = mergedCard(person->uniqueId(), hadBy(now, before), before, card,
                                       [&](const std::string& property) { return devices.knows(_c.device, property); });
@@ -202,6 +214,7 @@ Written CardWriter::putPerson(const ClientCard& card, const std::optional<Member
         }
         _rolvane.addRecord(person);
         expected.push_back({person->uniqueId(), std::nullopt});
+        if (!isShared) joinGroupsThatWaitFor(person, card.entity.uid);
     }
     if (_c.book.kind == Book::Kind::group) groupOf(_c.book)->addMember(person);
     const UniqueId uid = person->uniqueId();
@@ -216,7 +229,7 @@ Written CardWriter::putPerson(const ClientCard& card, const std::optional<Member
         change.commit();
     }
     const int64_t since = _rolvane.journalPosition();
-    save(expected);
+    if (!saveIfStill(expected)) return std::nullopt;
     if (!_memory.of(_c.book.id, uid)) throw Refused(409, "The card has left the book at the same moment.");
     const Date date = dateOfSave(expected.front(), since);
     {
@@ -224,19 +237,23 @@ Written CardWriter::putPerson(const ClientCard& card, const std::optional<Member
         _memory.keepWrittenOnly(uid, digest);
         change.commit();
     }
-    Devices(_memory).noteHad(_c.device, uid, date);
-    return {isWhole ? Library::tagOf(uid, date) : "", !now};
+    if (isWhole) Devices(_memory).noteHad(_c.device, {{uid, date}}); // else it has to read what it was merged with
+    return Written{isWhole ? Library::tagOf(uid, date) : "", !now};
 }
 
-Written CardWriter::putGroup(const ClientCard& card, const std::optional<Member>& now) {
+std::optional<Written> CardWriter::putGroup(const ClientCard& card, const std::optional<Member>& now) {
     auto group = std::dynamic_pointer_cast<CXGroup>(target(card, now));
     std::vector<CXExpected> expected;
     VCardEntity before;
-    bool mayRemove = _c.isConditional;
+    Dictionary stored;
+    std::optional<Dictionary> had;
+    bool mayRemove = _c.conditions.namesTag;
     if (group) {
+        stored = group->dictionaryRepresentation();
         before = groupEntity(_rolvane, *group);
         expected.push_back({group->uniqueId(), group->valueForProperty(kCXModificationDateProperty).date()});
-        if (now && expected.back().modified != now->modified) throw changedMeanwhile(); // as of a person
+        if (now && expected.back().modified != now->modified) return std::nullopt; // as of a person
+        had = hadBy(now, stored);
         mayRemove = mayRemove || Devices(_memory).had(_c.device, _c.book.id, *now).isPresent;
     } else {
         group =
@@ -244,10 +261,13 @@ Written CardWriter::putGroup(const ClientCard& card, const std::optional<Member>
         group->resetWithDictionary(card.entity.properties, true, false);
         _rolvane.addRecord(group);
         expected.push_back({group->uniqueId(), std::nullopt});
+        joinGroupsThatWaitFor(group, card.entity.uid);
     }
-    for (const auto& [name, value] : card.entity.properties)
-        if (group->valueForProperty(name) != value) group->setValue(value, name);
-    setMembers(group, card, before, mayRemove);
+    for (const auto& [name, value] : card.entity.properties) {
+        const bool isTheClients = !had || (*had)[name] != value; // else it is as the client found it
+        if (isTheClients && group->valueForProperty(name) != value) group->setValue(value, name);
+    }
+    setMembers(group, card, before, vcardKeptLines(stored, kVCardMissingMemberLine), mayRemove);
     const UniqueId uid = group->uniqueId();
     const VCardEntity after = groupEntity(_rolvane, *group);
     const bool isWhole = card.isWhole && after.members == card.entity.members &&
@@ -260,21 +280,21 @@ Written CardWriter::putGroup(const ClientCard& card, const std::optional<Member>
         change.commit();
     }
     const int64_t since = _rolvane.journalPosition();
-    save(expected);
+    if (!saveIfStill(expected)) return std::nullopt;
     if (!_memory.of(_c.book.id, uid)) throw Refused(409, "The group has left the book at the same moment.");
     const Date date = dateOfSave(expected.front(), since);
-    Devices(_memory).noteHad(_c.device, uid, date);
-    return {isWhole ? Library::tagOf(uid, date) : "", !now};
+    if (isWhole) Devices(_memory).noteHad(_c.device, {{uid, date}}); // else it has to read what it was merged with
+    return Written{isWhole ? Library::tagOf(uid, date) : "", !now};
 }
 
 // Members who have no card here are kept by their UIDs, as the import does. A client that never wrote a member does not
 // know of members.
-bool CardWriter::setMembers(const CXGroupRef& group, const ClientCard& card, const VCardEntity& before,
-                            bool mayRemove) {
+void CardWriter::setMembers(const CXGroupRef& group, const ClientCard& card, const VCardEntity& before,
+                            std::vector<VCardLine> missing, bool mayRemove) {
     std::set<std::string> said;
-    Dictionary properties = group->dictionaryRepresentation();
-    std::vector<VCardLine> missing;
-    if (!mayRemove) missing = vcardKeptLines(properties, kVCardMissingMemberLine);
+    const bool saysMembers = !card.entity.members.empty() || !card.entity.subgroups.empty();
+    const bool removes = mayRemove && (saysMembers || Devices(_memory).knows(_c.device, "line:MEMBER"));
+    if (removes) missing.clear();
     for (const auto* list : {&card.entity.members, &card.entity.subgroups})
         for (const std::string& uid : *list) {
             said.insert(vcardMemberKey(uid));
@@ -289,11 +309,8 @@ bool CardWriter::setMembers(const CXGroupRef& group, const ClientCard& card, con
                 if (std::find(missing.begin(), missing.end(), line) == missing.end()) missing.push_back(line);
             }
         }
-    const bool knowsMembers = !said.empty() || Devices(_memory).knows(_c.device, "line:MEMBER");
-    if (!mayRemove || !knowsMembers) return false;
-    vcardReplaceKeptLines(properties, kVCardMissingMemberLine, missing);
-    const Value& extras = properties[kCXVCardExtraProperty];
-    if (group->valueForProperty(kCXVCardExtraProperty) != extras) group->setValue(extras, kCXVCardExtraProperty);
+    setMissingMembers(group, missing);
+    if (!removes) return;
     for (const std::string& uid : before.members)
         if (!said.contains(vcardMemberKey(uid)))
             if (auto person = std::dynamic_pointer_cast<CXPerson>(recordOf(uid, kCXPersonTable)))
@@ -302,7 +319,31 @@ bool CardWriter::setMembers(const CXGroupRef& group, const ClientCard& card, con
         if (!said.contains(vcardMemberKey(uid)))
             if (auto subgroup = std::dynamic_pointer_cast<CXGroup>(recordOf(uid, kCXGroupTable)))
                 group->removeSubgroup(subgroup);
-    return true;
+}
+
+void CardWriter::setMissingMembers(const CXGroupRef& group, const std::vector<VCardLine>& missing) {
+    Dictionary properties = group->dictionaryRepresentation();
+    vcardReplaceKeptLines(properties, kVCardMissingMemberLine, missing);
+    const Value& extras = properties[kCXVCardExtraProperty];
+    if (group->valueForProperty(kCXVCardExtraProperty) != extras) group->setValue(extras, kCXVCardExtraProperty);
+}
+
+// Groups whose cards came before this one, and name it, list it from now on.
+void CardWriter::joinGroupsThatWaitFor(const CXRecordRef& record, const std::string& uid) {
+    for (const CXListing& line : _rolvane.listGroups(RemoteLocation(""))) {
+        const auto group = std::dynamic_pointer_cast<CXGroup>(_rolvane.recordForUniqueId(line.uniqueId));
+        if (!group || group->isAllGroup() || group->uniqueId() == record->uniqueId()) continue;
+        auto missing = vcardKeptLines(group->dictionaryRepresentation(), kVCardMissingMemberLine);
+        const auto isIt = [&](const VCardLine& each) {
+            return vcardMemberKey(vcardUnescape(each.value)) == vcardMemberKey(uid);
+        };
+        if (std::erase_if(missing, isIt) == 0) continue;
+        setMissingMembers(group, missing);
+        if (const auto person = std::dynamic_pointer_cast<CXPerson>(record))
+            group->addMember(person);
+        else if (const auto subgroup = std::dynamic_pointer_cast<CXGroup>(record); group->mayListSubgroup(subgroup))
+            group->addSubgroup(subgroup);
+    }
 }
 
 // Removing and moving ----------------------------------------------------------------------------------------------
@@ -310,17 +351,25 @@ bool CardWriter::setMembers(const CXGroupRef& group, const ClientCard& card, con
 void CardWriter::remove() {
     requireWritable(_c.book);
     const Turn turn(bookMemoryPath(_rolvane.path()) + ".lock");
-    const auto now = settle();
-    if (!now) throw Refused(404, "The card has gone already.");
-    if (_c.book.kind == Book::Kind::shared && isGroupRecord(now->uid))
-        throw notHere("Groups of other people stay theirs.");
-    const CXRecordRef record = _rolvane.recordForUniqueId(now->uid);
+    for (int round = 0; round < kRounds; ++round) {
+        const auto now = settle();
+        if (!now) throw Refused(404, "The card has gone already.");
+        if (_c.book.kind == Book::Kind::shared && isGroupRecord(now->uid))
+            throw notHere("Groups of other people stay theirs.");
+        if (removeIfStill(*now)) return;
+    }
+    throw savedAgainAndAgain();
+}
+
+bool CardWriter::removeIfStill(const Member& now) {
+    const CXRecordRef record = _rolvane.recordForUniqueId(now.uid);
     if (!record) throw Refused(404, "The card has gone already.");
     if (_c.book.kind == Book::Kind::group)
         groupOf(_c.book)->removeMember(std::dynamic_pointer_cast<CXPerson>(record));
     else
         _rolvane.removeRecord(record);
-    save(_c.isConditional ? std::vector<CXExpected>{{now->uid, now->modified}} : std::vector<CXExpected>{});
+    const bool isOfAVersion = _c.conditions.namesTag || _c.conditions.hasDate;
+    return saveIfStill(isOfAVersion ? std::vector<CXExpected>{{now.uid, now.modified}} : std::vector<CXExpected>{});
 }
 
 // The record of the card joins the book of a group.
@@ -348,7 +397,7 @@ bool CardWriter::copy(const Book& to, const std::string& name, bool mayReplace) 
     if (!isUsableName(name)) throw notHere("A card cannot be called so.");
     const Turn turn(bookMemoryPath(_rolvane.path()) + ".lock");
     const bool made = join(to, name, mayReplace);
-    save({});
+    save();
     return made;
 }
 
@@ -378,7 +427,7 @@ bool CardWriter::move(const Book& to, const std::string& name, bool mayReplace) 
     }
     const auto now = _memory.named(_c.book.id, _c.name);
     if (now) groupOf(_c.book)->removeMember(std::dynamic_pointer_cast<CXPerson>(_rolvane.recordForUniqueId(now->uid)));
-    save({});
+    save();
     return made;
 }
 

@@ -8,13 +8,26 @@
 
 namespace rolvane::cardbook {
 
+// What a request asks of the card that it changes (RFC 9110 section 13.1). All of it was judged once, before the body.
+struct Conditions {
+    bool namesTag = false; // If-Match with tags, one of which the card had: the client has had that version
+    bool exists = false;   // If-Match: *
+    bool isAbsent = false; // If-None-Match: *
+    bool hasDate = false;  // If-Unmodified-Since; a second is too coarse to name a version
+
+    // Do they hold for a card that is not the one any more that they were judged against?
+    bool holdAgain(bool isThere) const {
+        return !namesTag && !hasDate && !(exists && !isThere) && !(isAbsent && isThere);
+    }
+};
+
 // The device that writes, and the state that the request's conditions were judged against.
 struct WriteContext {
-    const Book& book;
+    Book book;
     std::string name; // of the card
     std::string base; // of the paths
     std::string device;
-    bool isConditional = false;   // If-Match or If-None-Match was there
+    Conditions conditions;
     std::optional<Member> judged; // what they were judged against
 };
 
@@ -23,9 +36,10 @@ struct Written {
     bool made = false;
 };
 
-// Changes the contact database for a client. Throws Refused, with nothing changed; conditions are looked at again in
-// the transaction. Writers wait for each other, across processes too. A change that was made is in the database when an
-// operation returns, and the memory has taken it in. One thread.
+// Changes the contact database for a client. Throws Refused, with nothing changed. Writers of books wait for each
+// other, across processes too. Where another program saves the record meanwhile, the conditions are looked at again
+// (412 where they do not hold any more), and the change is made anew against what that program saved. A change that was
+// made is in the database when an operation returns, and the memory has taken it in. One thread.
 class CardWriter {
 public:
     CardWriter(Library& library, WriteContext context);
@@ -45,14 +59,20 @@ private:
     [[noreturn]] void conflict(const Member& other, const std::string& book = {}); // in that book, else in this one
     void requireFreeUID(const ClientCard& card, const std::optional<Member>& now);
     CXRecordRef target(const ClientCard& card, const std::optional<Member>& now);
-    Written putPerson(const ClientCard& card, const std::optional<Member>& now);
-    Written putGroup(const ClientCard& card, const std::optional<Member>& now);
+    // Nothing: another program has saved the record meanwhile, and nothing was changed.
+    std::optional<Written> putPerson(const ClientCard& card, const std::optional<Member>& now);
+    std::optional<Written> putGroup(const ClientCard& card, const std::optional<Member>& now);
+    bool removeIfStill(const Member& now);
     std::optional<Dictionary> hadBy(const std::optional<Member>& now, const Dictionary& properties);
     void apply(const CXPersonRef& person, const Dictionary& before, const Dictionary& after);
-    bool setMembers(const CXGroupRef& group, const ClientCard& card, const VCardEntity& before, bool mayRemove);
+    void setMembers(const CXGroupRef& group, const ClientCard& card, const VCardEntity& before,
+                    std::vector<VCardLine> missing, bool mayRemove);
+    static void setMissingMembers(const CXGroupRef& group, const std::vector<VCardLine>& missing);
+    void joinGroupsThatWaitFor(const CXRecordRef& record, const std::string& uid);
     CXGroupRef groupOf(const Book& book);
     bool join(const Book& to, const std::string& name, bool mayReplace);
-    void save(const std::vector<CXExpected>& expected);
+    bool saveIfStill(const std::vector<CXExpected>& expected);
+    void save() { saveIfStill({}); }
     Date dateOfSave(const CXExpected& before, int64_t since);
     void wish(const Book& book, const UniqueId& uid, const std::string& name);
 

@@ -8,9 +8,20 @@ void Devices::noteLook(const std::string& device, const std::string& book, int64
     s.bind(1, device).bind(2, book).bind(3, sequence).bind(4, when.secondsSince1970()).run();
 }
 
-void Devices::noteHad(const std::string& device, const UniqueId& uid, Date modified) {
-    auto s = _sqlite.statement("INSERT OR REPLACE INTO had VALUES(?,?,?)");
-    s.bind(1, device).bind(2, uid.str()).bind(3, modified.secondsSince1970()).run();
+void Devices::noteHad(const std::string& device, const std::vector<std::pair<UniqueId, Date>>& cards) {
+    std::vector<const std::pair<UniqueId, Date>*> news;
+    for (const auto& card : cards) {
+        auto s = _sqlite.statement("SELECT 1 FROM had WHERE device=?1 AND uid=?2 AND date=?3");
+        if (!s.bind(1, device).bind(2, card.first.str()).bind(3, card.second.secondsSince1970()).step())
+            news.push_back(&card);
+    }
+    if (news.empty()) return;
+    SqliteTransaction transaction(_sqlite);
+    for (const auto* card : news) {
+        auto s = _sqlite.statement("INSERT OR REPLACE INTO had VALUES(?,?,?)");
+        s.bind(1, device).bind(2, card->first.str()).bind(3, card->second.secondsSince1970()).run();
+    }
+    transaction.commit();
 }
 
 void Devices::noteKnowledge(const std::string& device, const std::set<std::string>& properties) {

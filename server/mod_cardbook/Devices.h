@@ -12,15 +12,16 @@ class Devices {
 public:
     explicit Devices(BookMemory& memory) : _sqlite(memory.sqlite()) {}
 
-    // The device was told of all that a book held at that number and moment.
+    // The device was sent all cards that a book held at that number and moment. To be told of their tags is not to have
+    // them: the answer with the cards may never arrive.
     void noteLook(const std::string& device, const std::string& book, int64_t sequence, Date when);
-    // The device has had the card of that state, whatever it was told of its book.
-    void noteHad(const std::string& device, const UniqueId& uid, Date modified);
+    // The device was sent these cards, each of that state.
+    void noteHad(const std::string& device, const std::vector<std::pair<UniqueId, Date>>& cards);
     void noteKnowledge(const std::string& device, const std::set<std::string>& properties);
 
     bool knows(const std::string& device, const std::string& property);
 
-    // Which state of a card the device had.
+    // The state of a card that the device had last.
     struct Had {
         bool isPresent = false;   // the present one
         std::optional<Date> then; // one of that moment; nothing: not known

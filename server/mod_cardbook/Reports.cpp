@@ -30,6 +30,7 @@ public:
         default: sync();
         }
         _answer.finish();
+        noteWhatWasSent();
     }
 
 private:
@@ -70,6 +71,7 @@ private:
         uint64_t left = std::min<uint64_t>(_request.limit.value_or(kMostResponses), kMostResponses);
         size_t bytes = 0;
         bool isCut = false;
+        const int64_t latest = _library.memory().latest(book());
         forEachPage(0, false, [&](const std::vector<Member>& page) {
             _library.forEachCard(page, asked, [&](const Member& member, const Card* card) {
                 if (!card || isCut || !_request.filter.meets(card->text)) return;
@@ -84,23 +86,16 @@ private:
         });
         if (isCut)
             _answer.addStatus(_resource.path(), HTTP_INSUFFICIENT_STORAGE, "<D:number-of-matches-within-limits/>");
+        else if (_request.filter.isEverything() && sendsWholeCards())
+            _sentUntil = latest;
     }
 
     void sync() {
-        int64_t until = 0;
-        {
-            const SqliteSnapshot moment(_library.memory().sqlite());
-            syncAtOnce(until);
-        }
-        Devices(_library.memory())
-            .noteLook(_resource.r->user, book(), until, Date(static_cast<double>(_resource.r->request_time) / 1e6));
-    }
-
-    void syncAtOnce(int64_t& until) {
         BookMemory& memory = _library.memory();
+        const SqliteSnapshot moment(memory.sqlite());
         const bool isFirst = _request.token.empty();
         const int64_t from = isFirst ? 0 : numberOfToken(_library, book(), _request.token, refusalOfToken());
-        until = memory.latest(book());
+        int64_t until = memory.latest(book());
         uint64_t left = std::min<uint64_t>(_request.limit.value_or(kMostResponses), kMostResponses);
         bool isCut = false;
         forEachPage(from, !isFirst, [&](std::vector<Member>& page) {
@@ -118,6 +113,8 @@ private:
         if (isCut)
             _answer.addStatus(_resource.path(), HTTP_INSUFFICIENT_STORAGE, "<D:number-of-matches-within-limits/>");
         _answer.add("<D:sync-token>" + syncToken(_library, until) + "</D:sync-token>\n");
+        const bool hasFormerOnes = isFirst || Devices(memory).lookedAt(_resource.r->user, book()) >= from;
+        if (sendsWholeCards() && hasFormerOnes) _sentUntil = until;
     }
 
     // Thunderbird begins anew after 400 alone. After 403 it would ask with the same token for ever.
@@ -145,7 +142,7 @@ private:
             _library.forEachCard(run, version(), [&](const Member& member, const Card* card) {
                 if (!card) return _answer.addStatus(pathOfCard(member.name), HTTP_NOT_FOUND);
                 sendCard(member, *card);
-                if (_request.data) noteHad(member, *card);
+                noteHad(member, *card);
             });
             run.clear();
         };
@@ -160,12 +157,22 @@ private:
         flush();
     }
 
-    // Of a multiget: in the other reports the look at the book says it.
+    bool sendsWholeCards() const { return _request.data && _request.data->lines.empty(); }
+
+    // Of a multiget; whoever is sent a whole book has all of its cards.
     void noteHad(const Member& member, const Card& card) {
-        if (_request.kind != ReportRequest::Kind::multiget) return;
+        if (_request.kind != ReportRequest::Kind::multiget || !sendsWholeCards()) return;
         if (!_lookedAt) _lookedAt = Devices(_library.memory()).lookedAt(_resource.r->user, book());
-        if (member.sequence > *_lookedAt)
-            Devices(_library.memory()).noteHad(_resource.r->user, member.uid, card.modified);
+        if (member.sequence > *_lookedAt) _sent.emplace_back(member.uid, card.modified);
+    }
+
+    // Behind the last byte: a device whose answer broke off has nothing.
+    void noteWhatWasSent() {
+        Devices devices(_library.memory());
+        if (_sentUntil)
+            devices.noteLook(_resource.r->user, book(), *_sentUntil,
+                             Date(static_cast<double>(_resource.r->request_time) / 1e6));
+        devices.noteHad(_resource.r->user, _sent);
     }
 
     void sendCard(const Member& member, const Card& card) {
@@ -205,6 +212,8 @@ private:
     const ReportRequest& _request;
     Multistatus _answer;
     std::optional<int64_t> _lastSent, _lookedAt;
+    std::optional<int64_t> _sentUntil;            // all cards of the book as it was at that number
+    std::vector<std::pair<UniqueId, Date>> _sent; // others
 };
 
 } // namespace

@@ -105,9 +105,6 @@ dav_error* setHeaders(request_rec* r, const dav_resource* resource) noexcept {
         if (!it.member) return;
         it.card = it.library->card(*it.member, acceptedVersion(r));
         if (!it.card) throw Refused(HTTP_NOT_FOUND, "The card has just gone.");
-        Devices devices(it.library->memory());
-        if (!devices.isCoveredByLook(r->user, it.place.book, *it.member))
-            devices.noteHad(r->user, it.member->uid, it.card->modified);
         apr_table_set(r->headers_out, "ETag", it.card->tag.c_str());
         apr_table_setn(r->headers_out, "Vary", "Accept");
         ap_update_mtime(r, apr_time_from_sec(static_cast<apr_time_t>(it.card->modified.secondsSince1970())));
@@ -126,8 +123,14 @@ dav_error* deliver(const dav_resource* resource, ap_filter_t* output) noexcept {
     apr_bucket_brigade* brigade = apr_brigade_create(resource->pool, buckets);
     APR_BRIGADE_INSERT_TAIL(brigade, apr_bucket_pool_create(text.data(), text.size(), resource->pool, buckets));
     APR_BRIGADE_INSERT_TAIL(brigade, apr_bucket_eos_create(buckets));
-    if (ap_pass_brigade(output, brigade) == APR_SUCCESS) return nullptr;
-    return dav_new_error(resource->pool, HTTP_INTERNAL_SERVER_ERROR, 0, 0, "The answer could not be sent.");
+    if (ap_pass_brigade(output, brigade) != APR_SUCCESS)
+        return dav_new_error(resource->pool, HTTP_INTERNAL_SERVER_ERROR, 0, 0, "The answer could not be sent.");
+    if (!it.card) return nullptr;
+    return contained(it.r, [&] {
+        Devices devices(it.library->memory());
+        if (!devices.isCoveredByLook(it.r->user, it.place.book, *it.member))
+            devices.noteHad(it.r->user, {{it.member->uid, it.card->modified}});
+    });
 }
 
 // Visits a collection and, where asked, what is in it. The members of a book are made one at a time.
@@ -168,9 +171,6 @@ private:
 
     dav_error* visitMembers(const Resource& book) {
         constexpr size_t kPage = 500;
-        BookMemory& memory = book.library->memory();
-        Devices(memory).noteLook(book.r->user, book.place.book, memory.latest(book.place.book),
-                                 Date(static_cast<double>(book.r->request_time) / 1e6));
         const SqliteSnapshot moment(book.library->memory().sqlite());
         apr_pool_t* pool = nullptr;
         apr_pool_create(&pool, _parameters.pool);

@@ -27,16 +27,22 @@ Refused onlyCards() {
             "Books are made as groups and subscriptions, not here."};
 }
 
-bool hasConditions(const request_rec* r) {
-    for (const char* name : {"If-Match", "If-None-Match", "If-Unmodified-Since", "If"})
-        if (apr_table_get(r->headers_in, name)) return true;
-    return false;
+// Those that a further version may fail. The header If never gets here: nothing of it holds where there are no locks.
+Conditions conditionsOf(const request_rec* r) {
+    Conditions conditions;
+    const char *match = apr_table_get(r->headers_in, "If-Match"),
+               *other = apr_table_get(r->headers_in, "If-None-Match");
+    conditions.exists = match && *match == '*';
+    conditions.namesTag = match && *match != '*';
+    conditions.isAbsent = other && *other == '*';
+    conditions.hasDate = !match && apr_table_get(r->headers_in, "If-Unmodified-Since");
+    return conditions;
 }
 
 CardWriter writerOf(const Resource& it) {
     if (it.place.kind != Place::Kind::card) throw onlyCards();
     if (!it.book) throw Refused(HTTP_NOT_FOUND, "There is no such book.");
-    return {*it.library, WriteContext{*it.book, it.place.name, it.base, it.r->user, hasConditions(it.r), it.member}};
+    return {*it.library, WriteContext{*it.book, it.place.name, it.base, it.r->user, conditionsOf(it.r), it.member}};
 }
 
 } // namespace

@@ -34,7 +34,9 @@ protected:
     Written put(const std::string& name, const std::string& text) {
         library.catchUp();
         const Book book = *library.book(std::string(kContactsBook));
-        return CardWriter(library, {book, name, "/books", "laptop", true, library.memory().named(book.id, name)})
+        Conditions conditions;
+        conditions.namesTag = true;
+        return CardWriter(library, {book, name, "/books", "laptop", conditions, library.memory().named(book.id, name)})
             .put(text);
     }
     Card served(const std::string& name) {

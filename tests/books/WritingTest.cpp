@@ -131,7 +131,7 @@ TEST(Put, WithoutATagOverAnOlderVersionIsMergedByProperty) {
     phones.addValue("1", kCXHomeLabel);
     const auto ann = world.addPerson("Ann", "Lee", {{kCXPhoneProperty, phones.toValue()}, {kCXNoteProperty, "first"}});
     const std::string path = at(BooksWorld::uuidOf(ann) + ".vcf"), uid = "urn:uuid:" + BooksWorld::uuidOf(ann);
-    world.sync(kContacts, "");
+    world.multiget(kContacts, {path});
     ann->setValue("newer", kCXNoteProperty);
     world.rolvane().save();
     const auto written = world.put(path, cardOf(uid, "Ann", "Leigh", "NOTE:first\r\n"));
@@ -142,7 +142,7 @@ TEST(Put, WithoutATagOverAnOlderVersionIsMergedByProperty) {
     EXPECT_THAT(phonesOf(ann), testing::IsEmpty()) << "what it took away";
     EXPECT_TRUE(world.rolvane().conflicts().empty());
     // Both change one value: the later stays and the other one is noted.
-    world.sync(kContacts, "");
+    world.multiget(kContacts, {path});
     ann->setValue("theirs", kCXNoteProperty);
     world.rolvane().save();
     world.put(path, cardOf(uid, "Ann", "Leigh", "NOTE:mine\r\n"));
@@ -153,6 +153,76 @@ TEST(Put, WithoutATagOverAnOlderVersionIsMergedByProperty) {
     world.put(path, cardOf(uid, "Ann", "Leigh", "TEL;TYPE=CELL:9\r\n"), {}, "phone");
     EXPECT_EQ(ann->valueForProperty(kCXNoteProperty).string(), "mine");
     EXPECT_THAT(phonesOf(ann), testing::ElementsAre("9"));
+}
+
+// What the device was told of is not what it has: the answer with the cards may never have come.
+TEST(Put, WithoutATagByADeviceThatReadTagsAloneTakesNothingAway) {
+    BooksWorld world;
+    const auto ann = world.addPerson("Ann", "Lee");
+    const std::string path = at(BooksWorld::uuidOf(ann) + ".vcf"), uid = "urn:uuid:" + BooksWorld::uuidOf(ann);
+    world.multiget(kContacts, {path});
+    ann->setValue("newer", kCXNoteProperty);
+    world.rolvane().save();
+    world.sync(kContacts, "");
+    world.propfind(kContacts, 1, "<D:getetag/>");
+    world.ask("HEAD", path);
+    world.multiget(kContacts, {path}, "<C:address-data><C:prop name=\"FN\"/></C:address-data>");
+    EXPECT_EQ(world.put(path, cardOf(uid, "Ann", "Leigh")).status, 204);
+    EXPECT_EQ(ann->valueForProperty(kCXNoteProperty).string(), "newer");
+    EXPECT_EQ(ann->valueForProperty(kCXLastNameProperty).string(), "Leigh");
+}
+
+TEST(Put, WithoutATagTakesAwayWhatTheDeviceHasReadByWhateverRequest) {
+    const std::string query =
+        "<C:addressbook-query xmlns:D=\"DAV:\" xmlns:C=\"urn:ietf:params:xml:ns:carddav\"><D:prop>"
+        "<C:address-data/></D:prop><C:filter/></C:addressbook-query>";
+    const std::string sync = "<D:sync-collection xmlns:D=\"DAV:\" xmlns:C=\"urn:ietf:params:xml:ns:carddav\">"
+                             "<D:sync-token/><D:sync-level>1</D:sync-level><D:prop><C:address-data/></D:prop>"
+                             "</D:sync-collection>";
+    for (int way = 0; way < 4; ++way) {
+        BooksWorld world;
+        const auto ann = world.addPerson("Ann", "Lee", {{kCXNoteProperty, "so"}});
+        const std::string path = at(BooksWorld::uuidOf(ann) + ".vcf"), uid = "urn:uuid:" + BooksWorld::uuidOf(ann);
+        if (way == 0) world.ask("GET", path);
+        if (way == 1) world.multiget(kContacts, {path});
+        if (way == 2) world.report(kContacts, query);
+        if (way == 3) world.report(kContacts, sync);
+        EXPECT_EQ(world.put(path, cardOf(uid, "Ann", "Lee")).status, 204);
+        EXPECT_FALSE(ann->valueForProperty(kCXNoteProperty)) << way;
+    }
+}
+
+// Its answer had no tag, so the device does not know what the card says now.
+TEST(Put, WithoutATagTwiceTakesNothingAwayThatTheFirstWasMergedWith) {
+    BooksWorld world;
+    const auto ann = world.addPerson("Ann", "Lee");
+    const std::string path = at(BooksWorld::uuidOf(ann) + ".vcf"), uid = "urn:uuid:" + BooksWorld::uuidOf(ann);
+    world.multiget(kContacts, {path});
+    ann->setValue("newer", kCXNoteProperty);
+    world.rolvane().save();
+    EXPECT_EQ(world.put(path, cardOf(uid, "Ann", "Lee", "TEL;TYPE=CELL:1\r\n")).tag(), "");
+    world.put(path, cardOf(uid, "Ann", "Lee", "TEL;TYPE=CELL:1\r\nTEL;TYPE=WORK:2\r\n"));
+    EXPECT_EQ(ann->valueForProperty(kCXNoteProperty).string(), "newer");
+    EXPECT_THAT(phonesOf(ann), testing::UnorderedElementsAre("1", "2"));
+}
+
+// If-Match: * says that there is a card, If-Unmodified-Since names a second: neither says which version the device had.
+TEST(Put, UnderAConditionThatNamesNoVersionIsMergedByProperty) {
+    BooksWorld world;
+    const auto ann = world.addPerson("Ann", "Lee");
+    const std::string path = at(BooksWorld::uuidOf(ann) + ".vcf"), uid = "urn:uuid:" + BooksWorld::uuidOf(ann);
+    world.multiget(kContacts, {path});
+    ann->setValue("newer", kCXNoteProperty);
+    world.rolvane().save();
+    const std::string date = world.ask("GET", path, {}, {}, "phone").header("Last-Modified");
+    for (const BooksWorld::Headers& condition :
+         {BooksWorld::Headers{{"If-Match", "*"}}, BooksWorld::Headers{{"If-None-Match", "\"else\""}},
+          BooksWorld::Headers{{"If-Unmodified-Since", "Fri, 01 Jan 2100 00:00:00 GMT"}}}) {
+        EXPECT_EQ(world.put(path, cardOf(uid, "Ann", "Leigh"), condition).status, 204) << condition[0].first;
+        EXPECT_EQ(ann->valueForProperty(kCXNoteProperty).string(), "newer") << condition[0].first;
+        EXPECT_EQ(ann->valueForProperty(kCXLastNameProperty).string(), "Leigh");
+    }
+    EXPECT_NE(date, "");
 }
 
 TEST(Put, RefusesWhatIsNoCardAndChangesNothing) {
@@ -308,6 +378,33 @@ TEST(Groups, AreCardsInContacts) {
     EXPECT_EQ(world.ask("DELETE", at("g.vcf")).status, 204);
     EXPECT_FALSE(group->isAttached());
     EXPECT_TRUE(ann->isAttached());
+}
+
+// Programs that send many cards send them in any order.
+TEST(Groups, AreJoinedByMembersWhoseCardsComeLater) {
+    BooksWorld world;
+    const std::string head = "BEGIN:VCARD\r\nVERSION:4.0\r\nKIND:group\r\n";
+    const std::string inner = head + "UID:inner\r\nFN:Inner\r\nMEMBER:bob\r\nEND:VCARD\r\n";
+    const std::string outer =
+        head + "UID:outer\r\nFN:Outer\r\nMEMBER:urn:uuid:" + kUUID + "\r\nMEMBER:inner\r\nEND:VCARD\r\n";
+    ASSERT_EQ(world.put(at("outer.vcf"), outer, {{"If-None-Match", "*"}}).status, 201);
+    ASSERT_EQ(world.put(at("inner.vcf"), inner).status, 201) << "without a condition, too";
+    EXPECT_EQ(world.ask("GET", at("inner.vcf")).body, inner);
+    ASSERT_EQ(world.put(at("bob.vcf"), cardOf("bob", "Bob", "May")).status, 201);
+    ASSERT_EQ(world.put(at("ann.vcf"), cardOf("urn:uuid:" + kUUID, "Ann", "Lee")).status, 201);
+    const auto group = [&](const std::string& uid) {
+        return std::dynamic_pointer_cast<CXGroup>(
+            world.rolvane().recordForUniqueId(UniqueId(vcardUUIDForUID(uid) + ":CXGroup")));
+    };
+    ASSERT_TRUE(group("outer") && group("inner"));
+    EXPECT_EQ(group("outer")->memberUniqueIds(), std::vector<UniqueId>{personCalled(kUUID)});
+    EXPECT_EQ(group("inner")->memberUniqueIds(), std::vector<UniqueId>{personCalled(vcardUUIDForUID("bob"))});
+    ASSERT_EQ(group("outer")->subgroups().size(), 1u);
+    EXPECT_EQ(group("outer")->subgroups().front()->uniqueId(), group("inner")->uniqueId());
+    EXPECT_EQ(world.ask("GET", at("ann.vcf", bookOf(group("outer")))).status, 200);
+    const std::string served = world.ask("GET", at("outer.vcf")).body;
+    EXPECT_EQ(served.find("MEMBER:inner"), served.rfind("MEMBER:inner")) << served;
+    EXPECT_THAT(served, HasSubstr("MEMBER:urn:uuid:" + kUUID + "\r\n"));
 }
 
 TEST(GroupBooks, LetPeopleJoinAndLeaveWhoStayInContacts) {

@@ -198,8 +198,8 @@ public:
     std::optional<CXConflict> conflict(int64_t number);
     bool forgetConflict(int64_t number); // durable on return; false when there is none
 
-    // From the first call on, every program that saves an edit of a person keeps what the person was before (of 1,000
-    // edits). Durable on return.
+    // From the first call on, every program that saves an edit of a person or a group keeps what its properties were
+    // before (of 1,000 edits). Durable on return.
     void keepFormerVersions();
     // The encoded properties of that time; null when they are the present ones or not known.
     std::shared_ptr<const Bytes> formerVersion(const UniqueId& uid, Date at);

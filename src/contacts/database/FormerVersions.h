@@ -8,7 +8,7 @@
 
 namespace rolvane {
 
-// People's properties before their latest edits, for programs that are told of an edit without being told what it was
+// People's and groups' properties before their latest edits, for programs that are told of an edit without being told what it was
 // made of. Kept from when somebody asks for it, by every program that saves. Not locked. The writing operations want
 // an open transaction.
 class FormerVersions {
@@ -28,7 +28,7 @@ CREATE INDEX IF NOT EXISTS former_uid ON former(uid, replaced);
 
     void begin(); // makes the table, and is durable on return
     bool areKept();
-    // The encoded properties that the person had at that time, null when they are the present ones or not known.
+    // The encoded properties that the record had at that time, null when they are the present ones or not known.
     std::shared_ptr<const Bytes> of(const UniqueId& uid, Date at);
 
     void keep(const UniqueId& uid, Date modified, Date replaced, const Bytes& properties);

@@ -169,7 +169,7 @@ private:
     }
 
     void keepFormer(const StoredRow& row) {
-        if (!isPerson(row.kind)) return;
+        if (!isLogged(row.kind)) return;
         if (!_areFormerKept) _areFormerKept = _formerVersions.areKept();
         if (!*_areFormerKept) return;
         _formerVersions.keep(row.uid, row.modified, _date, *row.properties);
