@@ -3,6 +3,7 @@
 #include "server/mod_davacl/GroupFile.h"
 #include "server/mod_davacl/Uploads.h"
 
+#include <cstring>
 #include <fstream>
 #include <sstream>
 #include <sys/stat.h>
@@ -97,6 +98,27 @@ std::optional<Missing> missingOf(request_rec* r, const Configuration& c, const T
                                  const std::vector<Need>& needs) {
     for (const Need& need : needs)
         if (!isGranted(r, c, place, need)) return Missing{need.onParent ? place.parent() : place, need.privilege};
+    return std::nullopt;
+}
+
+bool isDeep(const request_rec* r) {
+    const char* depth = apr_table_get(r->headers_in, "Depth");
+    if (!depth) return std::strcmp(r->method, "REPORT") != 0;
+    return std::strcmp(depth, "0") != 0 && std::strcmp(depth, "1") != 0;
+}
+
+std::optional<Missing> missingWithin(request_rec* r, const Configuration& c, const TreePath& place) {
+    // A LOCK without a body renews one that is there.
+    const bool renews = std::strcmp(r->method, "LOCK") == 0 && !ap_request_has_body(r);
+    const unsigned needed = renews ? 0 : neededWithin(r->method, isDeep(r));
+    if (!needed || place.isBase() || (r->user && place.owner == r->user)) return std::nullopt;
+    const OwnersLists* lists = listsOf(r, c, place.owner);
+    if (!lists) return std::nullopt; // damaged: nobody but the owner has a right
+    for (const std::string& tree : lists->trees()) {
+        const auto within = TreePath::of("", "/" + place.owner + "/" + tree);
+        if (within && within->isWithin(place) && (privilegesOn(r, c, *within) & needed) != needed)
+            return Missing{place, static_cast<Privilege>(needed)};
+    }
     return std::nullopt;
 }
 

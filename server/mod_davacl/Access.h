@@ -48,7 +48,12 @@ unsigned privilegesOn(request_rec* r, const Configuration& c, const TreePath& pl
 // The first of the needs that is not met.
 std::optional<Missing> missingOf(request_rec* r, const Configuration& c, const TreePath& place,
                                  const std::vector<Need>& needs);
+// The same for what a deep request takes in besides: a list within the place may deny what is granted there. The
+// answer names the place itself, since whoever may not read a member need not know of it.
+std::optional<Missing> missingWithin(request_rec* r, const Configuration& c, const TreePath& place);
 Standing standingOf(const request_rec* r);
+// Infinity is what LOCK, COPY, MOVE and PROPFIND mean when they say nothing; REPORT means 0 (RFC 3253 section 3.6).
+bool isDeep(const request_rec* r);
 
 // The path of a place as a URL has it.
 std::string urlPathOf(request_rec* r, const Configuration& c, const TreePath& place);

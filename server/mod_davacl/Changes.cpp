@@ -86,6 +86,7 @@ std::optional<Missing> hold(request_rec* r, const Change& change) {
     if (state.guards.empty()) return std::nullopt; // the owner's right does not come from a list
     state.forgetLists();
     auto missing = change.source ? missingOf(r, *change.c, *change.source, change.sourceNeeds) : std::nullopt;
+    if (!missing && change.source) missing = missingWithin(r, *change.c, *change.source);
     if (!missing && change.destination) missing = missingOf(r, *change.c, *change.destination, change.destinationNeeds);
     if (missing) state.guards.clear();
     return missing;

@@ -17,6 +17,8 @@
 namespace rolvane::davacl {
 namespace {
 
+constexpr const char* kPrivate = "davacl_private";
+
 struct Setting {
     const char* module; // the settings of one that is not loaded are left out
     const char* lines;
@@ -95,6 +97,27 @@ void removeForeignFilters(request_rec* r) {
     }
 }
 
+// A cache looks at neither lists nor passwords, whoever runs it: this httpd, a proxy in front of it, or one in between.
+// Headers that the server sets for all its pages may say otherwise, so the last word is here.
+apr_status_t keepPrivate(ap_filter_t* filter, apr_bucket_brigade* brigade) noexcept {
+    request_rec* r = filter->r;
+    ap_filter_t* next = filter->next;
+    for (apr_table_t* headers : {r->headers_out, r->err_headers_out})
+        for (const char* name : {"Cache-Control", "Expires", "Surrogate-Control", "CDN-Cache-Control"})
+            apr_table_unset(headers, name);
+    apr_table_setn(r->headers_out, "Cache-Control", "private, no-cache");
+    r->no_cache = 0; // for the caches of this httpd, which have seen it; the header says it now
+    ap_remove_output_filter(filter);
+    return ap_pass_brigade(next, brigade);
+}
+
+void keepFromCaches(request_rec* r) {
+    for (const ap_filter_t* each = r->output_filters; each; each = each->next)
+        if (strcasecmp(each->frec->name, kPrivate) == 0) return;
+    r->no_cache = 1;
+    ap_add_output_filter(kPrivate, nullptr, r, r->connection);
+}
+
 // As mod_dav decides it itself; another module may have changed its mind since.
 const char* handlerFor(request_rec* r) {
     const dav_provider* provider = dav_get_provider(r);
@@ -160,6 +183,7 @@ int confine(request_rec* r) noexcept {
     return contained(r, static_cast<int>(HTTP_INTERNAL_SERVER_ERROR), [r]() -> int {
         const Configuration* c = configurationOf(r);
         if (!c || !isConfined(r, *c)) return isOfATree(r) ? static_cast<int>(HTTP_FORBIDDEN) : DECLINED;
+        if (!r->main) keepFromCaches(r);
         learnDirectory(r, *c);
         // Sub-requests with the same settings keep having the same ones: httpd need not ask for the password again.
         auto& known = stateOf(r).confined;
@@ -171,6 +195,19 @@ int confine(request_rec* r) noexcept {
         if (!mine) mine = withSettings(r, top->pool);
         r->per_dir_config = mine;
         return DECLINED;
+    });
+}
+
+void registerConfinement() noexcept {
+    // Behind the filters of caches and headers, before the one that writes the head of the answer.
+    ap_register_output_filter(kPrivate, keepPrivate, nullptr, static_cast<ap_filter_type>(AP_FTYPE_PROTOCOL - 1));
+}
+
+void confineError(request_rec* r) noexcept {
+    contained(r, false, [r] {
+        const Configuration* c = configurationOf(r);
+        if (c && isConfined(r, *c)) keepFromCaches(r);
+        return true;
     });
 }
 

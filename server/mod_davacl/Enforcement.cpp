@@ -48,13 +48,6 @@ bool mayOnEveryTree(request_rec* r, const Configuration& c, unsigned needed) {
            });
 }
 
-// Infinity is what LOCK, COPY, MOVE and PROPFIND mean when they say nothing; REPORT means 0 (RFC 3253 section 3.6).
-bool isDeep(const request_rec* r) {
-    const char* depth = apr_table_get(r->headers_in, "Depth");
-    if (!depth) return std::strcmp(r->method, "REPORT") != 0;
-    return (std::strcmp(depth, "0") != 0 && std::strcmp(depth, "1") != 0);
-}
-
 // A request may take in all trees without naming one of them.
 bool reachesIntoForeignTrees(request_rec* r, const Configuration& c, bool destination) {
     const unsigned needed = destination ? neededOfMembersReplaced() : neededOfMembers(r->method, isDeep(r));
@@ -100,6 +93,8 @@ int check(request_rec* r) {
     const Standing standing = standingOf(r);
     const auto missing =
         missingOf(r, *c, *place, destination ? needsOfDestination(r->method, standing) : needsOf(r->method, standing));
+    if (!missing && !r->main)
+        if (const auto within = missingWithin(r, *c, *place)) return refuse(r, *c, *within);
     if (!missing || (std::strcmp(r->method, "UNLOCK") == 0 && namesOwnLock(r))) return DECLINED;
     if (!r->main) return refuse(r, *c, *missing);
     if (destination) stateOf(r).destinationLacks = missing;

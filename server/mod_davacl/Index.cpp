@@ -143,7 +143,6 @@ int serve(request_rec* r) {
     if (!members) return HTTP_FORBIDDEN;
     const std::string page = pageFor(r, *place, *members);
     ap_set_content_type(r, "text/html; charset=utf-8");
-    apr_table_setn(r->headers_out, "Cache-Control", "private, no-cache");
     ap_set_content_length(r, static_cast<apr_off_t>(page.size()));
     if (!r->header_only) ap_rwrite(page.data(), static_cast<int>(page.size()), r);
     return OK;

@@ -52,6 +52,7 @@ void registerHooks(apr_pool_t* pool) noexcept {
     ap_hook_fixups(boundSlowThreads, nullptr, nullptr, APR_HOOK_REALLY_FIRST - 1);
     registerUploads();
     ap_hook_insert_filter(boundUpload, nullptr, nullptr, APR_HOOK_LAST);
+    ap_hook_insert_error_filter(confineError, nullptr, nullptr, APR_HOOK_LAST);
     ap_hook_insert_error_filter(leaveRefusedBody, nullptr, nullptr, APR_HOOK_MIDDLE);
     ap_hook_fixups(enforce, nullptr, nullptr, APR_HOOK_REALLY_FIRST);
     ap_hook_handler(servePrincipals, nullptr, beforeDav, APR_HOOK_FIRST);
@@ -65,6 +66,7 @@ void registerHooks(apr_pool_t* pool) noexcept {
     dav_register_liveprop_group(pool, &kLiveProperties);
     dav_options_provider_register(pool, "davacl", const_cast<dav_options_provider*>(&kOptions));
     registerChangeFilters();
+    registerConfinement();
     registerParking();
     registerPasswords(pool);
 }

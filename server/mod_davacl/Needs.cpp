@@ -57,6 +57,12 @@ unsigned neededOfMembersReplaced() {
     return kUnbind | kBind;
 }
 
+unsigned neededWithin(std::string_view method, bool deep) {
+    if (!deep) return 0;
+    if (method == "COPY") return kRead;
+    return method == "LOCK" ? unsigned{kWriteContent} : 0U;
+}
+
 bool changesSomething(std::string_view method) {
     return !isReader(method) && method != "UNLOCK" && method != "LOCK" && method != "ACL";
 }

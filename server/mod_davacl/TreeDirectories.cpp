@@ -25,6 +25,7 @@ struct Mapping {
 struct Guarded {
     std::shared_mutex mutex;
     std::vector<std::string> directories;
+    std::vector<Mapping> ownPlaces; // below a base, served by an Alias of their own
 };
 
 // Lives as long as the process: other threads may still ask when it ends.
@@ -61,10 +62,24 @@ void guard(const std::string& directory) {
         all.directories.push_back(directory);
 }
 
+bool isDirectory(const std::string& path) {
+    struct stat info {};
+    return stat(path.c_str(), &info) == 0 && S_ISDIR(info.st_mode);
+}
+
 bool isGuarded(const std::string& directory) {
     Guarded& all = guarded();
     const std::shared_lock lock(all.mutex);
     return std::find(all.directories.begin(), all.directories.end(), directory) != all.directories.end();
+}
+
+// The directory of the Alias that serves a URL path below a base; "" where that of the base does.
+std::string ownDirectoryOf(std::string_view uri) {
+    Guarded& all = guarded();
+    const std::shared_lock lock(all.mutex);
+    const auto found = std::find_if(all.ownPlaces.begin(), all.ownPlaces.end(),
+                                    [&](const Mapping& place) { return isWithin(uri, place.url); });
+    return found == all.ownPlaces.end() ? std::string() : found->directory;
 }
 
 // The virtual host whose section a directive stands in; the main server when it stands in none.
@@ -167,6 +182,12 @@ const char* findDirectories(apr_pool_t* pool, server_rec* main) {
         Guarded& all = guarded();
         const std::unique_lock lock(all.mutex);
         all.directories.clear();
+        all.ownPlaces.clear();
+        for (const server_rec* each = main; each; each = each->next)
+            for (const Mapping& alias : aliases)
+                if (const Configuration* c = configurationOf(each);
+                    c && alias.url != c->base && isWithin(alias.url, c->base))
+                    all.ownPlaces.push_back(alias);
     }
     for (const server_rec* each = main; each; each = each->next) {
         const Configuration* c = configurationOf(each);
@@ -191,13 +212,19 @@ const char* findDirectories(apr_pool_t* pool, server_rec* main) {
     return worst;
 }
 
-void learnDirectory(const request_rec* r, const Configuration& c) {
-    if (!r->filename || r->filename[0] != '/' || r->proxyreq != PROXYREQ_NONE) return;
-    const std::string rest = withoutSlash(r->uri + std::strlen(c.base));
-    const std::string file = withoutSlash(std::string(r->filename) + (r->path_info ? r->path_info : ""));
-    if (rest.size() < 2 || file.size() <= rest.size() || !file.ends_with(rest)) return;
-    const std::string directory = file.substr(0, file.size() - rest.size());
-    if (!isGuarded(directory)) guard(directory);
+// The site may have pages of its own below the base. What is served there without WebDAV is no tree, and an Alias tells
+// nothing of the trees beside it: guarding what is around the page would shut the site.
+void learnDirectory(request_rec* r, const Configuration& c) {
+    if (!r->filename || r->filename[0] != '/' || r->proxyreq != PROXYREQ_NONE || !dav_get_provider(r)) return;
+    std::string directory = ownDirectoryOf(r->uri);
+    if (directory.empty()) {
+        const std::string rest = withoutSlash(r->uri + std::strlen(c.base));
+        const std::string file = withoutSlash(std::string(r->filename) + (r->path_info ? r->path_info : ""));
+        if (rest.size() < 2 || file.size() <= rest.size() || !file.ends_with(rest)) return;
+        directory = file.substr(0, file.size() - rest.size());
+    }
+    // Where the directory's name comes out of the request, as that of its host, only one that is there counts.
+    if (!isGuarded(directory) && isDirectory(directory)) guard(directory);
 }
 
 bool isOfATree(const request_rec* r) {

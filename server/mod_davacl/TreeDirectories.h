@@ -12,7 +12,7 @@ namespace rolvane::davacl {
 // cannot close, or null.
 const char* findDirectories(apr_pool_t* pool, server_rec* server);
 // The directory behind the base, told by a request below it.
-void learnDirectory(const request_rec* r, const Configuration& c);
+void learnDirectory(request_rec* r, const Configuration& c);
 // Whether a request that is not below a base would be answered from one of these directories.
 bool isOfATree(const request_rec* r);
 

@@ -189,6 +189,37 @@ TEST_F(OnDebian, AnUploadedPageRunsNothingInABrowser) {
     EXPECT_THAT(answer.headers, HasSubstr("X-Content-Type-Options: nosniff"));
 }
 
+// Whoever asks for a file that mod_cache keeps gets it before anybody looks at a list or a password.
+TEST_F(OnDebian, TheServersCacheKeepsNothingOfATree) {
+    for (const char* module : {"cache", "cache_disk", "headers", "expires"}) httpd.enable(module);
+    std::filesystem::create_directory(httpd.path("cache"));
+    httpd.give(httpd.path("cache"));
+    httpd.addServerLines(
+        "CacheRoot \"" + httpd.path("cache") +
+        "\"\nCacheEnable disk /\nCacheIgnoreNoLastMod On\nCacheDefaultExpire 3600\n"
+        "ExpiresActive On\nExpiresDefault \"access plus 1 month\"\n"
+        "<FilesMatch \"\\.(jpg|css)$\">\nHeader set Cache-Control \"public, max-age=86400\"\n</FilesMatch>\n"
+        "<FilesMatch \"\\.png$\">\nHeader always set Cache-Control \"public\"\n"
+        "Header set Cache-Control \"s-maxage=3600\"\n</FilesMatch>\n"
+        "<FilesMatch \"\\.txt$\">\nRequestHeader unset Authorization\n</FilesMatch>\n");
+    begin();
+    std::ofstream(httpd.documents() + "/site.css") << "site";
+    for (int i = 0; i < 2; ++i) EXPECT_EQ(ask("", "GET", "/site.css").body, "site");
+    EXPECT_FALSE(std::filesystem::is_empty(httpd.path("cache"))) << "the cache works";
+    for (const char* name : {"photo.jpg", "photo.png", "plain.txt"}) {
+        ASSERT_EQ(status("alice", "PUT", contacts(name), {}, "alice's"), 201);
+        for (int i = 0; i < 2; ++i) {
+            const RawAnswer answer = ask("alice", "GET", contacts(name));
+            EXPECT_EQ(answer.body, "alice's");
+            EXPECT_THAT(answer.headers, HasSubstr("Cache-Control: private, no-cache")) << name;
+            for (const char* word : {"public", "max-age", "maxage", "Expires"})
+                EXPECT_THAT(answer.headers, Not(HasSubstr(word))) << name;
+        }
+        EXPECT_EQ(status("", "GET", contacts(name)), 401) << name;
+        EXPECT_EQ(status("sam", "GET", contacts(name)), 403) << name;
+    }
+}
+
 // Alias and a second virtual host lead to the same files without the base in their URL.
 TEST_F(OnDebian, TheFilesOfTheTreesAreServedAtTheBaseAndNowhereElse) {
     const std::string port = std::to_string(httpd.port());
@@ -213,6 +244,36 @@ TEST_F(OnDebian, TheFilesOfTheTreesAreServedAtTheBaseAndNowhereElse) {
     EXPECT_EQ(status("", "PUT", "/davacl/alice.acl", other, "davacl 1\nend\n"), 403);
     EXPECT_EQ(status("", "GET", "/dav-users", other), 200) << "that host is open: what is not a tree is its own matter";
     EXPECT_THAT(httpd.log(), HasSubstr("also reached as"));
+}
+
+// A part of the base's URLs may be the site's own: that opens no tree, and does not shut the site.
+TEST_F(OnDebian, APlaceOfTheSiteBelowTheBaseShutsNothingElse) {
+    std::filesystem::create_directory(httpd.documents() + "/help");
+    std::ofstream(httpd.documents() + "/help/page.txt") << "help";
+    std::ofstream(httpd.documents() + "/index.html") << "site";
+    httpd.addSiteLines("<Location /dav/help>\nAlias \"" + httpd.documents() + "/help\"\n</Location>\n");
+    begin();
+    EXPECT_EQ(ask("", "GET", "/index.html").body, "site");
+    for (const char* path : {"/dav/help/page.txt", "/dav/help/", "/dav/help/none"}) ask("", "GET", path);
+    EXPECT_EQ(ask("", "GET", "/index.html").body, "site") << "a request of a stranger's shuts nothing";
+    EXPECT_EQ(ask("", "GET", "/help/page.txt").body, "help");
+}
+
+// mod_cern_meta takes headers of an answer from a file beside the one that is sent.
+TEST_F(OnDebian, NobodyUploadsHeaders) {
+    httpd.enable("cern_meta");
+    httpd.addServerLines("<Location />\nMetaFiles On\n</Location>\n");
+    begin();
+    std::filesystem::create_directory(httpd.documents() + "/.web");
+    std::ofstream(httpd.documents() + "/.web/site.txt.meta") << "X-Site: yes\n";
+    std::ofstream(httpd.documents() + "/site.txt") << "site";
+    EXPECT_THAT(ask("", "GET", "/site.txt").headers, HasSubstr("X-Site: yes")) << "that is how it works";
+    ASSERT_EQ(status("walter", "MKCOL", contacts(".web")), 201);
+    ASSERT_EQ(status("walter", "PUT", contacts(".web/file.meta"), {}, "Set-Cookie: session=walters\nX-Walters: yes\n"),
+              201);
+    const RawAnswer answer = ask("alice", "GET", contacts("file"));
+    EXPECT_EQ(answer.body, "why");
+    EXPECT_THAT(answer.headers, Not(HasSubstr("alters")));
 }
 
 TEST_F(OnDebian, AWayAroundTheListsThatCannotBeClosedKeepsItFromStarting) {

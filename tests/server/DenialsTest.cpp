@@ -161,6 +161,39 @@ TEST_F(DenialsOnStore, TakeTheLocksOfWhomTheyConcern) {
     EXPECT_EQ(world->status("alice", "PUT", "/dav/alice/Contacts/dateFile", {}, "x"), 204);
 }
 
+TEST_F(DenialsOnStore, HoldForACopyOfAllThatIsAroundThem) {
+    ASSERT_EQ(set(AccessWorld::ace("<D:all/>", "read"), "/dav/alice/"), 200);
+    ASSERT_EQ(set(denial(AccessWorld::user("sam"), "read")), 200);
+    for (const auto& depth :
+         std::vector<std::vector<std::pair<std::string, std::string>>>{{}, {{"Depth", "infinity"}}}) {
+        auto headers = depth;
+        headers.emplace_back("Destination", "/dav/sam/loot");
+        const RawAnswer answer = world->ask("sam", "COPY", "/dav/alice/", headers);
+        EXPECT_EQ(answer.status, 403);
+        EXPECT_EQ(answer.precondition(), "need-privileges");
+        EXPECT_THAT(answer.body, testing::Not(testing::HasSubstr("Contacts"))) << "no listing shows its name either";
+    }
+    EXPECT_FALSE(std::filesystem::exists(world->store.userDirectory("sam") + "/loot"));
+    EXPECT_EQ(world->status("sam", "COPY", "/dav/alice/", {{"Destination", "/dav/sam/loot"}, {"Depth", "0"}}), 201);
+    EXPECT_TRUE(std::filesystem::is_empty(world->store.userDirectory("sam") + "/loot"));
+    EXPECT_EQ(world->status("rita", "COPY", "/dav/alice/", {{"Destination", "/dav/rita/copy"}}), 201);
+    EXPECT_EQ(world->status("alice", "COPY", "/dav/alice/Contacts/", {{"Destination", "/dav/alice/again"}}), 201);
+}
+
+TEST_F(DenialsOnStore, HoldForALockOnAllThatIsAroundThem) {
+    ASSERT_EQ(set(AccessWorld::ace(AccessWorld::user("walter"), "read write"), "/dav/alice/"), 200);
+    ASSERT_EQ(
+        set(denial(AccessWorld::user("walter"), "write") + AccessWorld::ace(AccessWorld::user("rita"), "read write")),
+        200);
+    ASSERT_EQ(world->status("walter", "PUT", "/dav/alice/Contacts/dateFile", {}, "x"), 403);
+    EXPECT_EQ(world->status("walter", "LOCK", "/dav/alice/", {}, AccessWorld::kLock), 403);
+    EXPECT_EQ(world->status("walter", "LOCK", "/dav/alice/", {{"Depth", "infinity"}}, AccessWorld::kLock), 403);
+    EXPECT_EQ(world->status("rita", "PUT", "/dav/alice/Contacts/dateFile", {}, "why"), 204);
+    EXPECT_EQ(world->status("walter", "LOCK", "/dav/alice/", {{"Depth", "0"}}, AccessWorld::kLock), 200);
+    EXPECT_EQ(world->status("rita", "PUT", "/dav/alice/Contacts/dateFile", {}, "why"), 204);
+    EXPECT_EQ(world->status("walter", "LOCK", "/dav/alice/own", {}, AccessWorld::kLock), 200);
+}
+
 TEST_F(DenialsOnStore, ForAGroupHoldWhileTheGroupFileIsMissing) {
     const std::string groups = world->store.stateDirectory() + "/conf/groups";
     ASSERT_EQ(set(denial(AccessWorld::group("others"), "read") + AccessWorld::ace("<D:authenticated/>", "read")), 200);
