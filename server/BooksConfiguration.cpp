@@ -112,6 +112,7 @@ std::map<std::string, std::string> renderBooksUnits(const BooksOptions& options,
         "[Service]\nExecStart=/lib/systemd/systemd-socket-proxyd --exit-idle-time=10min " +
         numbered("127.0.0.1", inner) + "\nNoNewPrivileges=yes\nPrivateTmp=yes\n";
 
+    // Requests carry passwords, and so would a core file.
     const std::string& state = options.stateDirectory;
     const std::string httpd = "[Unit]\nDescription=Rolvane: server of the address books\n"
                               "Documentation=man:rolvane(1)\nStopWhenUnneeded=yes\n\n"
@@ -119,7 +120,7 @@ std::map<std::string, std::string> renderBooksUnits(const BooksOptions& options,
                               pathInUnit(state) + "/run/httpd.pid\nExecStart=" + options.httpdProgram + " -d " +
                               inUnit(state) + " -f " + inUnit(state + "/conf/httpd.conf") +
                               " -k start\nKillMode=mixed\nTimeoutStopSec=10\nUMask=0077\nNoNewPrivileges=yes\n"
-                              "LockPersonality=yes\nLimitNOFILE=16384\n";
+                              "LockPersonality=yes\nLimitNOFILE=16384\nLimitCORE=0\n";
     return {
         {"rolvane-books.socket", socket}, {"rolvane-books.service", service}, {"rolvane-books-httpd.service", httpd}};
 }

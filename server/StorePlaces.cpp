@@ -50,6 +50,19 @@ void refuseForeignStep(const FileHandle& directory, const std::string& path) {
              "start the store as the user whom that directory belongs to.");
 }
 
+// Whoever may rename things in the directory of the documents could put a link in the place of the trees later.
+void refuseForeignDocuments(const FileHandle& documents, const std::string& path, const StoreIdentity& server) {
+    const struct stat info = statusOf(documents, path);
+    if (info.st_uid != 0 && info.st_uid != server.uid)
+        fail("The directory of the documents, " + path +
+             ", belongs to another user. Start the store as that user, or choose another directory with --root.");
+    const bool byGroup = (info.st_mode & S_IWGRP) != 0 && info.st_gid != 0 && info.st_gid != server.gid;
+    if ((byGroup || (info.st_mode & S_IWOTH) != 0) && (info.st_mode & S_ISVTX) == 0)
+        fail("The directory of the documents, " + path +
+             ", is one that somebody else may change. Take the right to write there away (chmod go-w), or choose "
+             "another directory with --root.");
+}
+
 FileHandle openedIn(const FileHandle& parent, const std::string& name, const std::string& path) {
     FileHandle directory(openat(parent.get(), name.c_str(), kDirectory));
     if (!directory) cannot("opened", path, errno);
@@ -151,6 +164,7 @@ void StorePlaces::makeAsRoot() const {
     for (const char* name : kServersOwn)
         giveTo(madeIn(state, name, _state + "/" + name), _identity.uid, _identity.gid, 0700, _state + "/" + name);
     const FileHandle documents = madeAlong(_documents);
+    if (_documents != _state + "/root") refuseForeignDocuments(documents, _documents, _identity);
     if (_documents == _state + "/root") giveTo(documents, 0, 0, 0711, _documents);
     giveTo(madeIn(documents, "dav", _documents + "/dav"), _identity.uid, _identity.gid, 0700, _documents + "/dav");
 }

@@ -107,6 +107,15 @@ std::string commandLine(pid_t pid) {
     }
 }
 
+// As httpd is started, with zero bytes between. An editor, or a pager, names the file alone.
+std::string argumentsOfHttpd(const std::string& configurationFile) {
+    const std::string state = std::filesystem::path(configurationFile).parent_path().parent_path().string();
+    std::string text;
+    for (const std::string& argument : {std::string(), std::string("-d"), state, std::string("-f"), configurationFile})
+        text += argument + '\0';
+    return text;
+}
+
 } // namespace
 
 FileHandle::~FileHandle() {
@@ -172,8 +181,7 @@ std::optional<StoreProcess> StoreProcess::find(pid_t pid, const std::string& con
     // Opened first, read then: the number cannot change hands between the two without the handle becoming readable.
     const std::string line = commandLine(pid);
     StoreProcess process(pid, std::move(handle));
-    const std::string argument = std::string(1, '\0') + configurationFile + '\0';
-    if (line.find(argument) == std::string::npos || process.hasExited()) return std::nullopt;
+    if (line.find(argumentsOfHttpd(configurationFile)) == std::string::npos || process.hasExited()) return std::nullopt;
     return process;
 }
 

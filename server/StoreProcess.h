@@ -50,7 +50,8 @@ struct StoreIdentity {
 // A running program, seen through a pidfd, so that a number that was given to somebody else is never taken for it.
 class StoreProcess {
 public:
-    // The process with that number if its command line names the configuration file; nothing else passes for a store.
+    // The process with that number if it was started as httpd with the configuration file, STATE/conf/httpd.conf;
+    // nothing else passes for a store.
     static std::optional<StoreProcess> find(pid_t pid, const std::string& configurationFile);
     // Every such process of this machine: httpd's master and its workers.
     static std::vector<StoreProcess> findAll(const std::string& configurationFile);

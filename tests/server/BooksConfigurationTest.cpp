@@ -106,6 +106,9 @@ TEST(BooksUnits, AreWhatSystemdTakes) {
               (std::set<std::string>{"ListenStream=127.0.0.1:4711", "ListenStream=[::1]:4711",
                                      "ListenStream=192.168.1.20:4711"}));
     EXPECT_THAT(units.at("rolvane-books-httpd.service"), HasSubstr("a b%%c$$d/books/conf/httpd.conf\" -k start"));
+    EXPECT_EQ(linesThatBeginWith(units.at("rolvane-books-httpd.service"), "LimitCORE="),
+              (std::set<std::string>{"LimitCORE=0"}))
+        << "requests carry passwords, and so would a core file";
 }
 
 TEST(BooksDevices, HaveEachAPasswordOfTheirOwnThatIsKeptAsAHashOnly) {

@@ -3,6 +3,7 @@
 #include "foundation/CXException.h"
 #include "foundation/Paths.h"
 #include "server/StoreProcess.h"
+#include "support/ChildProcess.h"
 
 #include <cerrno>
 #include <fcntl.h>
@@ -194,6 +195,47 @@ TEST_P(RootsStore, DoesNotLieWhereSomebodyElseMayMoveIt) {
     PrivateStoreOptions documents = options();
     documents.documentRoot = directory.path("theirs/documents");
     EXPECT_THAT(reasonOf([&] { PrivateStore(documents).start(); }), HasSubstr("must not lie below"));
+}
+
+// Who owns the directory of the documents may put a link in the place of the trees at any time.
+TEST_P(RootsStore, DoesNotServeDocumentsFromADirectoryOfSomebodyElse) {
+    constexpr uid_t kSomebody = 54321;
+    PrivateStoreOptions documents = options();
+    documents.documentRoot = directory.path("documents");
+    ASSERT_EQ(mkdir(documents.documentRoot.c_str(), 0755), 0);
+    ASSERT_EQ(chown(documents.documentRoot.c_str(), kSomebody, kSomebody), 0);
+    EXPECT_THAT(reasonOf([&] { PrivateStore(documents).start(); }), HasSubstr("belongs to another user"));
+    EXPECT_EQ(statusOf(documents.documentRoot).st_uid, kSomebody);
+    EXPECT_TRUE(std::filesystem::is_empty(documents.documentRoot));
+    ASSERT_EQ(chown(documents.documentRoot.c_str(), 0, 0), 0);
+    ASSERT_EQ(chmod(documents.documentRoot.c_str(), 0777), 0);
+    EXPECT_THAT(reasonOf([&] { PrivateStore(documents).start(); }), HasSubstr("somebody else may change"));
+    ASSERT_EQ(chmod(documents.documentRoot.c_str(), 0755), 0);
+    PrivateStore store(documents);
+    store.start();
+}
+
+// The number of the process stands where httpd's user writes.
+TEST_P(RootsStore, EndsNoProgramOfRootsForANumberInTheServersFile) {
+    PrivateStore store(options());
+    store.addUser("alice", "a");
+    store.start();
+    store.stop();
+    test::ChildProcess reader(
+        {"sh", "-c", "tail -n +1 -f \"$1\" & echo number $!; wait", "sh", state + "/conf/httpd.conf"});
+    const auto line = reader.waitForLine("^number ");
+    ASSERT_TRUE(line);
+    const std::string forged = state + "/run/httpd.pid", number = line->substr(7) + "\n";
+    ASSERT_EQ(server().run([&] {
+        const int file = open(forged.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+        return write(file, number.data(), number.size()) == static_cast<ssize_t>(number.size()) ? 0 : 1;
+    }),
+              0);
+    EXPECT_FALSE(store.status().running);
+    store.stop(PrivateStore::Stop::atOnce);
+    EXPECT_TRUE(reader.running());
+    store.start();
+    EXPECT_TRUE(reader.running()) << "what is left of an earlier httpd is ended, and nothing else";
 }
 
 TEST_P(RootsStore, DoesNotTakeADirectoryThatServesSomethingElse) {
