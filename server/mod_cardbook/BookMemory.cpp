@@ -245,6 +245,16 @@ bool BookMemory::note(std::string_view book, const UniqueId& uid, Date modified)
 }
 
 bool BookMemory::noteGone(std::string_view book, const UniqueId& uid) {
+    if (!leave(book, uid)) return false;
+    _sqlite
+        .statement("DELETE FROM written WHERE uid=?1 AND NOT EXISTS "
+                   "(SELECT 1 FROM members m WHERE m.uid=?1 AND NOT m.gone)")
+        .bind(1, uid.str())
+        .run();
+    return true;
+}
+
+bool BookMemory::leave(std::string_view book, const UniqueId& uid) {
     const int64_t number = numberOf(book, false);
     if (!of(book, uid)) return false;
     const int64_t sequence = nextSequence();
@@ -259,6 +269,8 @@ void BookMemory::noteBookGone(std::string_view book) {
     _sqlite.statement("DELETE FROM members WHERE book=?").bind(1, number).run();
     _sqlite.statement("DELETE FROM wishes WHERE book=?").bind(1, number).run();
     _sqlite.statement("DELETE FROM books WHERE id=?").bind(1, number).run();
+    _sqlite.execute("DELETE FROM written WHERE NOT EXISTS "
+                    "(SELECT 1 FROM members m WHERE m.uid=written.uid AND NOT m.gone)");
 }
 
 void BookMemory::wish(std::string_view book, const UniqueId& uid, std::string_view name) {
@@ -269,7 +281,7 @@ void BookMemory::wish(std::string_view book, const UniqueId& uid, std::string_vi
 // Its former name leaves under an identifier that no record has.
 void BookMemory::rename(std::string_view book, const Member& member, std::string_view name) {
     const int64_t number = numberOf(book, false);
-    noteGone(book, member.uid);
+    leave(book, member.uid); // the text stays the card's
     auto s = _sqlite.statement("UPDATE members SET uid=?3 WHERE book=?1 AND uid=?2");
     s.bind(1, number).bind(2, member.uid.str()).bind(3, "former:" + std::to_string(_sequence)).run();
     wish(book, member.uid, name);

@@ -72,6 +72,7 @@ public:
     void setPosition(int64_t position, const Bytes& history);
     // The card is in the book, at that state. True when that is news.
     bool note(std::string_view book, const UniqueId& uid, Date modified);
+    // A card that then stands in no book leaves no text behind.
     bool noteGone(std::string_view book, const UniqueId& uid);
     void ensureBook(std::string_view book);
     void noteBookGone(std::string_view book);
@@ -95,6 +96,7 @@ public:
 
 private:
     int64_t nextSequence();
+    bool leave(std::string_view book, const UniqueId& uid);
     int64_t numberOf(std::string_view book, bool make);
     std::string nameFor(int64_t book, const UniqueId& uid);
     bool isTaken(int64_t book, std::string_view name, const UniqueId& uid);

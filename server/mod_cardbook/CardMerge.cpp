@@ -78,10 +78,14 @@ Dictionary completed(const Dictionary& written, const Dictionary& had, const Kno
     const Array* lines = had[kCXVCardExtraProperty].arrayIf();
     if (!lines) return all;
     Array kept = all[kCXVCardExtraProperty].arrayIf() ? all[kCXVCardExtraProperty].array().mutableCopy() : Array();
+    std::set<std::string> known;
+    for (const Value& text : kept) known.insert(text.string());
     for (const Value& text : *lines) {
-        if (text.string().starts_with('+') || kept.contains(text)) continue;
+        if (text.string().starts_with('+') || known.contains(text.string())) continue;
         const auto line = vcardParseLine(text.string());
-        if (line && line->name != "UID" && !knows(lineKnowledge(line->name))) kept.append(text);
+        if (!line || line->name == "UID" || knows(lineKnowledge(line->name))) continue;
+        known.insert(text.string());
+        kept.append(text);
     }
     if (!kept.empty()) all.set(kCXVCardExtraProperty, kept);
     return all;

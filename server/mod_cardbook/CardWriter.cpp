@@ -156,10 +156,12 @@ CXGroupRef CardWriter::groupOf(const Book& book) {
 
 Written CardWriter::put(const std::string& text) {
     requireWritable(_c.book);
-    const ClientCard card = readClientCard(text);
+    const ClientCard card = readClientCard(text, Bounds::ofClients);
     if (!isUsableName(_c.name)) throw notHere("A card cannot be called so.");
     if (card.entity.isGroup && _c.book.kind != Book::Kind::contacts)
         throw notHere("Cards of groups are written in \"Contacts\".");
+    if (!Devices(_memory).mayLearn(_c.device, knowledgeOf(card)))
+        throw Refused(403, kCardSpace, "valid-address-data", "This device has written too many kinds of properties.");
     const Turn turn(bookMemoryPath(_rolvane.path()) + ".lock");
     for (int round = 0; round < kRounds; ++round) {
         const auto now = settle();
@@ -295,6 +297,8 @@ void CardWriter::setMembers(const CXGroupRef& group, const ClientCard& card, con
     const bool saysMembers = !card.entity.members.empty() || !card.entity.subgroups.empty();
     const bool removes = mayRemove && (saysMembers || Devices(_memory).knows(_c.device, "line:MEMBER"));
     if (removes) missing.clear();
+    std::set<std::string> known; // the values of `missing`
+    for (const VCardLine& line : missing) known.insert(line.value);
     for (const auto* list : {&card.entity.members, &card.entity.subgroups})
         for (const std::string& uid : *list) {
             said.insert(vcardMemberKey(uid));
@@ -306,7 +310,7 @@ void CardWriter::setMembers(const CXGroupRef& group, const ClientCard& card, con
                 VCardLine line;
                 line.name = kVCardMissingMemberLine;
                 line.value = vcardEscape(uid);
-                if (std::find(missing.begin(), missing.end(), line) == missing.end()) missing.push_back(line);
+                if (known.insert(line.value).second) missing.push_back(line);
             }
         }
     setMissingMembers(group, missing);

@@ -22,6 +22,22 @@ VCardEntity entityOf(const VCard& card) {
     return std::move(*entity);
 }
 
+// More than any program writes. What comes behind compares lines and values with each other. Members are looked up.
+constexpr size_t kMostLines = 1000, kMostOfALine = 1000;
+
+void refuseTooMany(const VCard& card) {
+    size_t lines = 0;
+    for (const VCardLine& line : card.lines) {
+        if (line.name == "MEMBER" || line.name == "X-ADDRESSBOOKSERVER-MEMBER") continue;
+        if (++lines > kMostLines) invalid("The card has more than " + std::to_string(kMostLines) + " lines.");
+        size_t values = line.name == "CATEGORIES" || line.name == "NICKNAME"
+                            ? static_cast<size_t>(std::count(line.value.begin(), line.value.end(), ','))
+                            : 0;
+        for (const VCardParameter& parameter : line.parameters) values += 1 + parameter.values.size();
+        if (values > kMostOfALine) invalid("The line " + line.name + " has too many values.");
+    }
+}
+
 // The part of a UID that is kept, since its record's identifier does not say it in the same letters.
 void keepUID(VCardEntity& entity) {
     if (entity.uid == vcardUIDForUUID(vcardUUIDForUID(entity.uid))) return;
@@ -33,7 +49,7 @@ void keepUID(VCardEntity& entity) {
 
 } // namespace
 
-ClientCard readClientCard(const std::string& text) {
+ClientCard readClientCard(const std::string& text, Bounds bounds) {
     if (!isUtf8(text)) invalid("The card is not UTF-8.");
     std::istringstream in(text);
     std::string why;
@@ -47,6 +63,7 @@ ClientCard readClientCard(const std::string& text) {
     if (card->version != "3.0" && card->version != "4.0")
         throw Refused(403, kCardSpace, "supported-address-data", "Cards are text/vcard of version 3.0 or 4.0.");
 
+    if (bounds == Bounds::ofClients) refuseTooMany(*card);
     ClientCard read;
     read.text = text;
     read.isVersion4 = card->version == "4.0";

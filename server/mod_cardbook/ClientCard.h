@@ -16,8 +16,12 @@ struct ClientCard {
     std::string text;
 };
 
-// Throws Refused: valid-address-data for a text that is no vCard, holds several, or has no name;
-// supported-address-data for another version than 3.0 and 4.0. Pure.
-ClientCard readClientCard(const std::string& text);
+// Of the lines and values of a card. Those of a client have bounds that no program comes near. A card that is made here
+// of what the database holds has none.
+enum class Bounds { none, ofClients };
+
+// Throws Refused: valid-address-data for a text that is no vCard, holds several, has no name, or more than the bounds
+// allow; supported-address-data for another version than 3.0 and 4.0. Pure.
+ClientCard readClientCard(const std::string& text, Bounds bounds = Bounds::none);
 
 } // namespace rolvane::cardbook

@@ -25,9 +25,25 @@ void Devices::noteHad(const std::string& device, const std::vector<std::pair<Uni
 }
 
 void Devices::noteKnowledge(const std::string& device, const std::set<std::string>& properties) {
+    const std::vector<std::string> fresh = unknown(device, properties);
+    if (fresh.empty()) return;
+    SqliteTransaction transaction(_sqlite);
+    for (const std::string& property : fresh)
+        _sqlite.statement("INSERT OR IGNORE INTO knows VALUES(?,?)").bind(1, device).bind(2, property).run();
+    transaction.commit();
+}
+
+bool Devices::mayLearn(const std::string& device, const std::set<std::string>& properties) {
+    const auto fresh = static_cast<int64_t>(unknown(device, properties).size());
+    auto count = _sqlite.statement("SELECT count(*) FROM knows WHERE device=?");
+    return fresh == 0 || (count.bind(1, device).step() && count.integer(0) + fresh <= kMostKnown);
+}
+
+std::vector<std::string> Devices::unknown(const std::string& device, const std::set<std::string>& properties) {
+    std::vector<std::string> all;
     for (const std::string& property : properties)
-        if (!knows(device, property))
-            _sqlite.statement("INSERT OR IGNORE INTO knows VALUES(?,?)").bind(1, device).bind(2, property).run();
+        if (!knows(device, property)) all.push_back(property);
+    return all;
 }
 
 bool Devices::knows(const std::string& device, const std::string& property) {

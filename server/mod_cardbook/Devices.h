@@ -18,6 +18,9 @@ public:
     // The device was sent these cards, each of that state.
     void noteHad(const std::string& device, const std::vector<std::pair<UniqueId, Date>>& cards);
     void noteKnowledge(const std::string& device, const std::set<std::string>& properties);
+    // False where the device would understand more properties than any program does.
+    bool mayLearn(const std::string& device, const std::set<std::string>& properties);
+    static constexpr int64_t kMostKnown = 5000; // of a device
 
     bool knows(const std::string& device, const std::string& property);
 
@@ -33,6 +36,8 @@ public:
     }
 
 private:
+    std::vector<std::string> unknown(const std::string& device, const std::set<std::string>& properties);
+
     Sqlite& _sqlite;
 };
 

@@ -14,6 +14,8 @@ using davacl::child;
 using davacl::isDav;
 using davacl::textOf;
 
+constexpr size_t kMostNames = 1000; // each is looked for in every card
+
 [[noreturn]] void badRequest(const std::string& words) {
     throw Refused(400, words);
 }
@@ -29,6 +31,7 @@ AddressData addressDataOf(const apr_xml_doc* doc, const apr_xml_elem* element) {
         if (!isCard(doc, e, "prop")) continue; // C:allprop says what is the rule anyway
         const std::string name = vcardUpper(attributeOf(e, "name"));
         if (name.empty()) badRequest("A C:prop of an address-data names no property.");
+        if (data.lines.size() == kMostNames) badRequest("An address-data names too many properties.");
         data.lines.push_back({name, attributeOf(e, "novalue") == "yes"});
     }
     return data;
@@ -36,6 +39,7 @@ AddressData addressDataOf(const apr_xml_doc* doc, const apr_xml_elem* element) {
 
 void readProperties(const apr_xml_doc* doc, const apr_xml_elem* prop, ReportRequest& request) {
     for (const apr_xml_elem* e = prop->first_child; e; e = e->next) {
+        if (request.properties.size() == kMostNames) badRequest("The report asks for too many properties.");
         if (isCard(doc, e, "address-data"))
             request.data = addressDataOf(doc, e);
         else

@@ -10,6 +10,7 @@
 #include <cerrno>
 #include <filesystem>
 #include <limits>
+#include <span>
 
 namespace rolvane {
 
@@ -428,17 +429,19 @@ std::vector<CXListing> CXRolvane::peopleFound(const CXSearchQuery& query) {
 }
 
 void CXRolvane::forEachOf(const std::vector<UniqueId>& uids, const std::function<void(const CXRow&)>& call) {
-    for (size_t from = 0; from < uids.size(); from += kPage) {
-        const size_t to = std::min<size_t>(uids.size(), from + kPage);
+    for (std::span<const UniqueId> rest = uids; !rest.empty();) {
+        const auto page = rest.first(std::min<size_t>(rest.size(), kPage));
+        size_t taken = page.size();
         std::unique_lock lock(_impl->mutex);
         std::vector<CXRow> rows;
         if (_impl->work.empty()) {
-            rows = _impl->store.rowsOf({uids.begin() + static_cast<long>(from), uids.begin() + static_cast<long>(to)});
+            rows = _impl->store.rowsOf(page, taken);
         } else {
-            for (size_t i = from; i < to; i++)
-                if (auto row = isPerson(_impl->kind(uids[i])) ? _impl->row(uids[i], true) : std::nullopt)
+            for (const UniqueId& uid : page)
+                if (auto row = isPerson(_impl->kind(uid)) ? _impl->row(uid, true) : std::nullopt)
                     rows.push_back(std::move(*row));
         }
+        rest = rest.subspan(taken);
         lock.unlock();
         for (const CXRow& row : rows) call(row);
     }

@@ -571,17 +571,23 @@ std::vector<UniqueId> RecordStore::peopleWhoseIdentifierBegins(std::string_view 
     return uids;
 }
 
-std::vector<CXRow> RecordStore::rowsOf(const std::vector<UniqueId>& uids) {
+std::vector<CXRow> RecordStore::rowsOf(std::span<const UniqueId> uids, size_t& taken) {
+    constexpr size_t kMostBytes = 8 << 20; // photos make contacts large
     SqliteSnapshot snapshot(_database);
+    size_t bytes = 0;
+    taken = 0;
     std::vector<CXRow> rows;
     std::vector<int64_t> ids;
     auto s = _database.statement("SELECT id, uid, location, created, modified, properties, writer FROM records "
                                  "WHERE uid=?1 AND kind IN (1,2)");
     for (const UniqueId& uid : uids) {
+        if (bytes > kMostBytes) break;
+        ++taken;
         s.bind(1, uid.str());
         if (s.step()) {
             ids.push_back(s.integer(0));
             rows.push_back(rowOf(s));
+            bytes += rows.back().encoded->size();
         }
         s.reset();
     }

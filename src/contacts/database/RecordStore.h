@@ -7,6 +7,7 @@
 #include <array>
 #include <functional>
 #include <set>
+#include <span>
 
 namespace rolvane {
 
@@ -87,8 +88,9 @@ public:
     std::vector<Line> linesFound(const std::function<bool(std::string_view)>& passes);
     // Identifiers of people that begin so, letter case aside.
     std::vector<UniqueId> peopleWhoseIdentifierBegins(std::string_view start);
-    // Rows with their parents, in this order; those that are not there are left out.
-    std::vector<CXRow> rowsOf(const std::vector<UniqueId>& uids);
+    // Rows with their parents, in this order; those that are not there are left out. Only the first ones where all of
+    // them would fill the memory: `taken` tells how many identifiers were looked up, one at least.
+    std::vector<CXRow> rowsOf(std::span<const UniqueId> uids, size_t& taken);
     void forEachLine(RecordKind kind, const std::function<void(Line)>& call);
 
     // Past the indexes, or by one of them alone: for finding out which of them is damaged --------------------------
