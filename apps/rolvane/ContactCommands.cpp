@@ -13,6 +13,7 @@
 #include "ValueNames.h"
 
 #include "contacts/database/History.h"
+#include "contacts/database/OneTurn.h"
 #include "contacts/vcard/TextCharset.h"
 #include "contacts/vcard/VCardExport.h"
 #include "contacts/vcard/VCardImport.h"
@@ -289,7 +290,10 @@ void add(Context& context, const PersonFields& fields, const std::vector<std::st
 void edit(Context& context, const std::string& name, const PersonFields& fields) {
     const CXPersonRef person = findPerson(context.database(), name);
     requireWritable(*person);
-    fields.applyTo(*person);
+    {
+        const OneTurn turn(context.database()); // a list is changed as it was read
+        fields.applyTo(*person);
+    }
     const bool changed = context.database().hasUnsavedChanges();
     context.database().save();
     tell(context, *person, changed ? "changed" : "stays as it was");

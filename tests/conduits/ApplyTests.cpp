@@ -451,6 +451,45 @@ TEST_F(Apply, ALocationThatIsItsOwnBaseLocationKeepsItsManager) {
     EXPECT_EQ(rooted.ACLManagerForRemoteLocation(Url(kBobsLocation.str() + "/Friends")), first);
 }
 
+// A clock that lets another program save at the moment when a change is noted.
+class SavingClock : public Clock {
+public:
+    explicit SavingClock(const Clock& clock) : _clock(clock) {}
+    Date now() const override {
+        if (const auto save = std::exchange(saves, nullptr)) save();
+        return _clock.now();
+    }
+    mutable std::function<void()> saves;
+
+private:
+    const Clock& _clock;
+};
+
+TEST_F(Apply, WhatAnotherProgramSavesWhileAVersionIsTakenInStays) {
+    const auto ada = person("Ada", "A");
+    save();
+    database.setCommonVersion(ada->uniqueId(), ada->encodedRepresentation());
+    save();
+    SavingClock saving(clock);
+    CXRolvane::Options options = daemonDatabase(directory, clock, center);
+    options.clock = &saving;
+    CXRolvane own(options);
+    CXDCXConduit conduitOfOwn(engine, {own, preferences, saving, center, 1, "another program"});
+    saving.saves = [&] {
+        ada->setValue("typed meanwhile", kCXNoteProperty);
+        database.save();
+    };
+    Dictionary arrived = card("Ada", kOwnLocation);
+    arrived.set(kCXOrganizationProperty, "theirs");
+    bool denied = false;
+    EXPECT_TRUE(
+        conduitOfOwn.applyChangeRecord(record(CXDUpdateRecord, "<self>", "A:CXPerson", nullptr, arrived), &denied));
+    EXPECT_FALSE(saving.saves) << "it was saved";
+    own.save();
+    EXPECT_EQ(ada->valueForProperty(kCXOrganizationProperty).string(), "theirs");
+    EXPECT_EQ(ada->valueForProperty(kCXNoteProperty).string(), "typed meanwhile");
+}
+
 // -- whose it is
 
 TEST_F(Apply, AnotherUsersRecordNeverReachesTheOwnersOwnPeopleAndGroups) {

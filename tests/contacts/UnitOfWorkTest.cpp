@@ -203,6 +203,51 @@ TEST(UnitOfWork, ChangesOfTwoProcessesToDifferentPropertiesAreBothKept) {
     EXPECT_EQ(there->dictionaryRepresentation(), a->dictionaryRepresentation());
 }
 
+// A save may wait for another one, and what that one has written into the same list is not taken away.
+TEST(UnitOfWork, ChangesOfTwoProcessesToOneListOfAPersonAreBothKept) {
+    TestDatabase db;
+    const auto list = [](const std::vector<std::string>& values) {
+        CXMutableMultiValue multi;
+        for (const std::string& value : values) multi.addValue(value, kCXHomeLabel);
+        return multi.toValue();
+    };
+    const auto added = [](const CXPersonRef& person, const std::string& value) {
+        CXMutableMultiValue multi;
+        const auto before = person->multiValueForProperty(kCXEmailProperty);
+        for (const auto& entry : before->entries()) multi.addValue(entry.value, entry.label, entry.identifier);
+        multi.addValue(value, kCXHomeLabel);
+        person->setValue(multi.toValue(), kCXEmailProperty);
+    };
+    const auto values = [](const CXPersonRef& person) {
+        std::set<std::string> all;
+        const auto multi = person->multiValueForProperty(kCXEmailProperty);
+        for (const auto& entry : multi->entries()) all.insert(entry.value.string());
+        return all;
+    };
+    const auto ours = db.addPerson("Ann");
+    ours->setValue(list({"a", "b"}), kCXEmailProperty);
+    db->save();
+    auto other = db.open("other");
+    const auto theirs = std::dynamic_pointer_cast<CXPerson>(other->recordForUniqueId(ours->uniqueId()));
+    added(ours, "ours");
+    ours->setValue("our note", kCXNoteProperty);
+    added(theirs, "theirs");
+    theirs->setValue("their note", kCXNoteProperty);
+    other->save();
+    db->save();
+    EXPECT_EQ(values(ours), (std::set<std::string>{"a", "b", "ours", "theirs"}));
+    EXPECT_EQ(values(theirs), values(ours));
+    EXPECT_EQ(ours->valueForProperty(kCXNoteProperty).string(), "our note") << "the later save's";
+    ASSERT_EQ(db->conflicts().size(), 1u) << "and the other one can be put back";
+    EXPECT_EQ(db->conflicts()[0].merge.lost[kCXNoteProperty].string(), "their note");
+    // What one takes away of a list leaves what the other has added.
+    ours->setValue(list({"a"}), kCXEmailProperty);
+    added(theirs, "more");
+    other->save();
+    db->save();
+    EXPECT_EQ(values(ours), (std::set<std::string>{"a", "more"}));
+}
+
 TEST(UnitOfWork, AReadSeesWhatAnotherProcessHasSaved) {
     TestDatabase d;
     CXPersonRef a = d.addPerson("A");

@@ -4,6 +4,7 @@
 #include "conduits/database/CXDCXConduit.h"
 #include "conduits/database/ContactWrites.h"
 #include "contacts/database/CXRolvane.h"
+#include "contacts/database/OneTurn.h"
 #include "contacts/records/Constants.h"
 #include "contacts/records/ContactMerge.h"
 #include "contacts/records/Identifier.h"
@@ -180,16 +181,19 @@ bool CXDCXConduit::updateRecord(const CXDChangeRecordPtr& record) {
 // An edit that was not sent meets a version of somebody else's: nothing of either is lost. The edit waits in the queue,
 // is delivered after the pass, or is found by the next scan.
 void CXDCXConduit::takeIn(const CXDChangeRecord& record, CXPerson& person, const Dictionary& content) {
-    const auto common = rolvane().commonVersion(person.uniqueId());
-    const bool hasEdit = common ? common->properties != nullptr : hasUncapturedEdit(person.uniqueId());
-    if (!hasEdit) {
-        person.resetWithDictionary(content, true, false);
-        rolvane().setCommonVersion(person.uniqueId(), person.encodedRepresentation());
-        return;
+    std::optional<CXCommonVersion> common;
+    bool hasEdit = false;
+    Dictionary ours;
+    {
+        // An edit that is saved between these lines would count as known to what arrives, and be lost.
+        const OneTurn turn(rolvane());
+        common = rolvane().commonVersion(person.uniqueId());
+        hasEdit = common ? common->properties != nullptr : hasUncapturedEdit(person.uniqueId());
+        if (hasEdit) ours = person.dictionaryRepresentation();
+        person.resetWithDictionary(content, true, false); // what is not known goes
     }
-    const Dictionary ours = person.dictionaryRepresentation();
-    person.resetWithDictionary(content, true, false); // what is not known goes
     const auto theirs = person.encodedRepresentation();
+    if (!hasEdit) return rolvane().setCommonVersion(person.uniqueId(), theirs);
     const Dictionary there = BinaryValue::decode(*theirs).dictionary(), here = cxAsSent(ours);
     CXMergeResult merge = cxMergedWithStore(common, here, there, CXSide::ours, std::nullopt);
     if (!merge.conflicts.empty()) {

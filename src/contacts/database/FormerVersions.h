@@ -8,9 +8,9 @@
 
 namespace rolvane {
 
-// People's and groups' properties before their latest edits, for programs that are told of an edit without being told what it was
-// made of. Kept from when somebody asks for it, by every program that saves. Not locked. The writing operations want
-// an open transaction.
+// People's and groups' properties before their latest edits, for programs that are told of an edit without being told
+// what it was made of. Kept from when somebody asks for it, by every program that saves. Not locked. The writing
+// operations want an open transaction.
 class FormerVersions {
 public:
     explicit FormerVersions(Sqlite& database) : _database(database) {}

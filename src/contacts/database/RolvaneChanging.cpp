@@ -68,8 +68,10 @@ PendingRecord& CXRolvane::Impl::pending(const UniqueId& uid) {
     RecordKind is = kind(uid);
     bool known = work.find(uid) != nullptr;
     std::string was = known ? std::string() : location(uid);
-    PendingRecord& p = work.touch(uid, is, storedRow(uid).has_value(), clock.now());
+    const std::optional<StoredRow> row = storedRow(uid);
+    PendingRecord& p = work.touch(uid, is, row.has_value(), clock.now());
     if (!known) p.location = was;
+    if (!known && row && isPerson(is)) p.knownRow = row->properties;
     return p;
 }
 
@@ -97,7 +99,8 @@ void CXRolvane::Impl::replaceProperties(const UniqueId& uid, Dictionary fresh) {
     for (const char* kept : {kCXUIDProperty, kCXCreationDateProperty, kCXModificationDateProperty}) fresh.remove(kept);
     PendingRecord& p = pending(uid);
     work.replace(p, fresh);
-    if (const auto& row = storedRow(uid); row && !p.isInsertion()) p.replacedRow = row->properties;
+    // What was changed first was made against that row, and this replacement is made of it.
+    if (const auto& row = storedRow(uid); row && !p.isInsertion() && !p.knownRow) p.knownRow = row->properties;
     p.location = locationOf(is, fresh);
 }
 
@@ -105,7 +108,7 @@ void CXRolvane::Impl::insert(const UniqueId& uid, RecordKind is, const Dictionar
     const auto row = storedRow(uid);
     PendingRecord& p = work.insert(uid, is, row.has_value(), clock.now());
     work.replace(p, fresh);
-    if (row && !p.isInsertion()) p.replacedRow = row->properties;
+    if (row && !p.isInsertion()) p.knownRow = row->properties;
     p.location = locationOf(is, fresh);
 }
 

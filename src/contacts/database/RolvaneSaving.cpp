@@ -125,12 +125,14 @@ private:
         return once && _store.firstOfLocation(record.kind, record.location).has_value();
     }
 
-    // A replacement that another process has overtaken: what it changed stays as it left it.
+    // A change that another process has overtaken: what it changed stays as it left it, and of one list both changes.
     Dictionary withChangesOfOthers(const Dictionary& ours, const PendingRecord& record, const StoredRow& row) {
-        const Dictionary before = BinaryValue::decode(*record.replacedRow).dictionary();
+        const Dictionary before = BinaryValue::decode(*record.knownRow).dictionary();
         const Dictionary theirs = BinaryValue::decode(*row.properties).dictionary();
         if (isPerson(record.kind)) {
-            CXMergeResult merge = mergedContact(before, theirs, ours, CXSide::ours);
+            // A replacement gives way to what was typed meanwhile; of two edits the later save's stands.
+            const CXSide stands = record.replaced ? CXSide::ours : CXSide::theirs;
+            CXMergeResult merge = mergedContact(before, theirs, ours, stands);
             Dictionary& contact = merge.contact;
             for (CXMergeConflict& each : merge.conflicts)
                 _conflicts.note({0, row.uid, deriveColumns(row.kind, contact).display, _date, std::move(each)});
@@ -152,9 +154,9 @@ private:
     }
 
     void updateRow(const UniqueId& uid, const PendingRecord& record, const StoredRow& row) {
-        Dictionary before = record.replaced ? Dictionary() : BinaryValue::decode(*row.properties).dictionary();
-        Dictionary after = record.over(before);
-        const bool changedMeanwhile = record.replacedRow && *record.replacedRow != *row.properties;
+        const bool changedMeanwhile = record.knownRow && *record.knownRow != *row.properties;
+        const Bytes& known = changedMeanwhile ? *record.knownRow : *row.properties;
+        Dictionary after = record.over(record.replaced ? Dictionary() : BinaryValue::decode(known).dictionary());
         if (changedMeanwhile) after = withChangesOfOthers(after, record, row);
         Bytes encoded = changedMeanwhile ? BinaryValue::encode(after) : encodedOf(record, after);
         if (encoded == *row.properties && record.kind == row.kind) return; // nothing has changed after all
@@ -163,7 +165,7 @@ private:
         keepFormer(row);
         if (isLogged(row.kind)) _log.note(row.uid, CXDetailKind::changed, {}, row.properties.get());
         _store.updateRow(row.id, record.kind, after, encoded, _date,
-                         changedMeanwhile ? row.writer : _program); // it holds an edit of theirs
+                         changedMeanwhile && record.replaced ? row.writer : _program); // it holds an edit of theirs
         note(record.kind == RecordKind::allGroup ? UniqueId(_identity + ":" + std::string(kCXInfoTable)) : uid,
              CXChangeKind::updated);
     }

@@ -110,7 +110,7 @@ void UnitOfWork::remove(const UniqueId& uid, RecordKind kind, bool inStore, Date
     PendingRecord& record = touch(uid, kind, inStore, now);
     if (record.whole) _size -= record.whole->size();
     record.whole.reset();
-    record.replacedRow.reset();
+    record.knownRow.reset();
     if (!record.inStore) {
         _records.erase(uid);
         return;

@@ -25,8 +25,9 @@ struct PendingRecord {
     bool replaced = false; // nothing stored counts any more: `whole` with `changes` are all properties there are
     // Properties that were given as a whole, encoded: 50,000 records must not stand in memory as trees of objects.
     std::shared_ptr<const Bytes> whole;
-    // The stored properties that the replacement knew: what another process has changed in them since is kept.
-    std::shared_ptr<const Bytes> replacedRow;
+    // The stored properties that the replacement knew, or a person's before the first change: what another process has
+    // changed in them since is kept.
+    std::shared_ptr<const Bytes> knownRow;
     std::map<std::string, Value, std::less<>> changes; // an absent value: the property is removed
     std::string location;                              // as it is with the changes
     Date touched;
