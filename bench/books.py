@@ -69,6 +69,14 @@ class Worker:
             fields = file.read().rsplit(")", 1)[1].split()
         return (int(fields[11]) + int(fields[12])) / TICK
 
+    def exact_cpu(self):
+        """In seconds, to the nanosecond; of the threads that live."""
+        total = 0
+        for task in os.listdir(f"/proc/{self.pid}/task"):
+            with open(f"/proc/{self.pid}/task/{task}/schedstat") as file:
+                total += int(file.read().split()[0])
+        return total / 1e9
+
     def memory(self, which="VmHWM"):
         with open(f"/proc/{self.pid}/status") as file:
             return int(re.search(which + r":\s+(\d+)", file.read()).group(1)) / 1024
@@ -166,23 +174,26 @@ def measure(client, worker, environment):
     timed("multiget of all in batches of 100", all_cards, PEOPLE)
     timed("listing with tags", lambda: client.ask("PROPFIND", BOOK, f"<D:propfind {SPACES}><D:prop><D:getetag/>"
                                                   "</D:prop></D:propfind>"), PEOPLE)
-    times, sizes = [], []
+    times, sizes, used = [], [], []
     for i in range(20):
         subprocess.run([CLI, "edit", f"{i:08x}", "--note", f"change {i}"], env=environment, check=True,
-                       stdout=subprocess.DEVNULL)
-        start = time.monotonic()
+                       stdout=subprocess.DEVNULL, stderr=subprocess.DEVNULL)
+        start, cpu = time.monotonic(), worker.exact_cpu()
         body, token = sync(client, token)
         changed = re.findall(rb"<D:href>([^<]*)</D:href>", body)
         status, card = client.ask("REPORT", BOOK, f"<C:addressbook-multiget {SPACES}><D:prop><C:address-data/></D:prop>"
                                   f"<D:href>{changed[0].decode()}</D:href></C:addressbook-multiget>")
         times.append(time.monotonic() - start)
+        used.append(worker.exact_cpu() - cpu)
         sizes.append(len(body) + len(card))
         assert len(changed) == 1 and status == 207, body
     times.sort()
-    print(f"a change later, sync-collection and multiget: {times[10] * 1000:.1f} ms (median of 20, {times[-1] * 1000:.1f} "
-          f"at most), {max(sizes)} bytes")
-    if times[10] > CHANGE_SECONDS or max(sizes) > CHANGE_BYTES:
-        failures.append(f"a change costs more than {CHANGE_SECONDS * 1000:.0f} ms or {CHANGE_BYTES} bytes")
+    used.sort()
+    print(f"a change later, sync-collection and multiget: CPU {used[10] * 1000:.1f} ms (median of 20, {used[-1] * 1000:.1f} "
+          f"at most), by the clock {times[10] * 1000:.1f} ms, {max(sizes)} bytes")
+    # The clock tells what else the machine had to do, and the client's own work.
+    if used[10] > CHANGE_SECONDS or max(sizes) > CHANGE_BYTES:
+        failures.append(f"a change costs more than {CHANGE_SECONDS * 1000:.0f} ms of CPU or {CHANGE_BYTES} bytes")
     if worker.memory() > MEGABYTES:
         failures.append(f"the worker takes more than {MEGABYTES} MB")
     return failures

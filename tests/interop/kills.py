@@ -3,6 +3,8 @@ daemons are killed again and again. Nothing may be lost, and nothing doubled."""
 
 import os
 import random
+import re
+import shutil
 import signal
 import subprocess
 import threading
@@ -56,6 +58,7 @@ class Client(threading.Thread):
         self.dav, self.words, self.edits = dav, words, edits
         self.random, self.failure, self.held = random.Random(seed), None, {}
         self.conditions = {"met": 0, "late": 0, "none": 0, "repeated": 0}
+        self.story = []  # of requests that change something, for whoever looks for what was lost
 
     def run(self):
         try:
@@ -108,6 +111,8 @@ class Client(threading.Thread):
             card = card.replace("END:VCARD", f"EMAIL;TYPE=HOME:{word}\r\nEND:VCARD")
             condition = {} if blind else {"If_Match": tag}
             status, answered, body = self.ask("PUT", self.address(name), card, Content_Type="text/vcard", **condition)
+            self.story.append((time.time(), name, word, tag, "blind" if blind else "tag", status,
+                               answered and answered.get("ETag"), sorted(re.findall(r"(\w+)@example", card))))
             if status in (201, 204):
                 self.conditions["none" if blind else "met"] += 1
                 self.read(name)
@@ -239,7 +244,17 @@ def kills(build, root, make_owner, check, edits, seed):
         failures = [writer.failure for writer in writers if writer.failure]
         if failures:
             raise Failure("; ".join(failures))
-        agree([(owner, "--own"), (subscriber, "--of=ada")], words)
+        try:
+            agree([(owner, "--own"), (subscriber, "--of=ada")], words)
+        except Failure:
+            keep = os.environ.get("ROLVANE_KEEP")  # a directory for the databases and what the clients did
+            if keep:
+                shutil.copytree(root, keep, dirs_exist_ok=True, ignore_dangling_symlinks=True,
+                                ignore=lambda _, names: [name for name in names if "sock" in name or "bus" in name])
+                with open(os.path.join(keep, "story"), "w") as file:
+                    for client in clients:
+                        file.writelines(f"{client.name} {line}\n" for line in client.story)
+            raise
         served = len([name for name in owner.book().names()])
         check(served == len(words.of), f"{served} cards are served, as many as there are contacts")
         how = {key: sum(client.conditions[key] for client in clients) for key in clients[0].conditions}

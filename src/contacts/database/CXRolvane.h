@@ -152,8 +152,8 @@ public:
     // The unit of work -----------------------------------------------------------------------------------------------
     // Writes all unsaved changes in one transaction with one journal entry a record, then tells the other processes.
     // Nothing unsaved: nothing happens. An update of a record that another process has removed meanwhile is dropped;
-    // other processes' changes to other properties of the same record are kept, of a person (or a whole replacement)
-    // their changes to any: lists are merged. Of two processes that subscribe to one location at a time, the first
+    // other processes' changes to other properties of the same record are kept, of a person or a whole replacement
+    // their changes to any (lists are merged). Of two processes that subscribe to one location at a time, the first
     // one's subscription stays. True always; throws on failure.
     bool save();
     // The same, where every one of these records is still as it is taken to be; looked at in the transaction. False,
