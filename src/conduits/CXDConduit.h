@@ -109,11 +109,13 @@ public:
         return applyChangeRecordIfNeeded(record, nullptr);
     }
 
-    // The changes of a user's group that its store does not have yet, and with them the contents of new members. None:
-    // this source cannot tell. Base: none.
-    virtual std::optional<CXDChangeRecords> changesOfGroupNow(const UserName& /*user*/, const UniqueId& /*group*/) {
-        return std::nullopt;
-    }
+    // The changes of a group of the owner's that its store does not have yet, and with them the contents of new
+    // members. None: this source cannot tell. Base: none.
+    virtual std::optional<CXDChangeRecords> changesOfGroupNow(const UniqueId& /*group*/) { return std::nullopt; }
+
+    // Are a tree's contacts to be written before its list of everybody, and other groups behind it? Somebody may read
+    // them at any moment. Main thread. Base: no.
+    virtual bool writesInOrder(const UserName& /*user*/) { return false; }
 
     // The next gathering makes the same change by itself, for as long as it is to be made. Base: no.
     virtual bool findsAgain(const CXDChangeRecord& /*record*/) const { return false; }

@@ -70,7 +70,10 @@ TEST(Hardening, TheTestNoticesAFileThatHasNone) {
 }
 
 void install(const std::string& prefix, const std::vector<std::string>& more = {}) {
-    std::vector<std::string> command = {ROLVANE_CMAKE, "--install", ROLVANE_BINARY_DIR, "--prefix", prefix};
+    // It writes into the directory of the build, so two of them take turns.
+    std::vector<std::string> command = {
+        "flock", ROLVANE_BINARY_DIR "/install.lock", ROLVANE_CMAKE, "--install", ROLVANE_BINARY_DIR, "--prefix",
+        prefix};
     command.insert(command.end(), more.begin(), more.end());
     ChildProcess installing(command);
     const auto ending = installing.wait(120);

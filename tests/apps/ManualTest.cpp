@@ -70,7 +70,8 @@ std::vector<std::string> linksOf(const std::string& document) {
 TEST_F(Manual, LinksOfInstalledDocumentsLeadSomewhere) {
     namespace fs = std::filesystem;
     const std::string prefix = world.home / "usr";
-    const Ran installed = world.run({ROLVANE_CMAKE, "--install", ROLVANE_BINARY_DIR, "--prefix", prefix});
+    const Ran installed = world.run({"flock", ROLVANE_BINARY_DIR "/install.lock", ROLVANE_CMAKE, "--install",
+                                     ROLVANE_BINARY_DIR, "--prefix", prefix});
     ASSERT_EQ(installed.status, 0) << installed;
     for (const std::string& page : kPages)
         EXPECT_TRUE(fs::exists(prefix + "/share/man/man" + page.substr(page.rfind('.') + 1) + "/" + page)) << page;

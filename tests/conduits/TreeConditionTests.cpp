@@ -216,6 +216,22 @@ TEST(TreeCondition, AContactIsUnlistedWhereNoGroupNamesIt) {
     EXPECT_TRUE(unlisted({UniqueId("c:CXPerson")}).empty()) << "no list, no judgement";
 }
 
+TEST(TreeCondition, ANameIsNowhereWhereNeitherAFileNorAListHasIt) {
+    const Dictionary state{{kPeopleState, Dictionary{{kMemberUIDState, Dictionary{{"file:CXPerson", Dictionary()}}}}},
+                           {"AllCXGroup", Dictionary{{kMemberUIDState, Array{"listed:CXPerson"}},
+                                                     {kSubgroupUIDState, Array{"L:CXGroup"}}}},
+                           {"G:CXGroup", Dictionary{{kMemberUIDState, Array{"member:CXPerson"}},
+                                                    {kSubgroupUIDState, Array{"S:CXGroup"}}}}};
+    std::vector<UniqueId> asked;
+    for (const char* name : {"file:CXPerson", "listed:CXPerson", "member:CXPerson", "gone:CXPerson", "L:CXGroup",
+                             "S:CXGroup", "G:CXGroup", "gone:CXGroup"})
+        asked.emplace_back(name);
+    EXPECT_EQ(namesThatAreNowhere(state, asked), (std::vector{UniqueId("gone:CXPerson"), UniqueId("gone:CXGroup")}));
+    EXPECT_TRUE(namesThatAreNowhere(state, {}).empty());
+    state["AllCXGroup"].dictionary().remove(kMemberUIDState);
+    EXPECT_TRUE(namesThatAreNowhere(state, asked).empty()) << "no list, no judgement";
+}
+
 TEST(TreeCondition, AGroupThatHasLeftItsOwnersDatabaseAndTheTreeIsDeletedThoughEverybodysListNamesIt) {
     const Dictionary now = without(tree(), "G:CXGroup");
     const auto isHere = [](const UniqueId& uid) { return uid.str() != "G:CXGroup"; };

@@ -1,5 +1,5 @@
-// Changes of the owner's that waited while the store was away say what was true when they were made. What the store
-// gets with the first pass that reaches it is what the database says by then.
+// Changes that waited while the store was away say what was true when they were made. What the store gets with the
+// first pass that reaches it is what the database says by then.
 
 #include "TwoUsers.h"
 
@@ -20,9 +20,10 @@ protected:
         EXPECT_EQ(copies(), alice.view()) << log.text();
     }
     // No write succeeds, though it may have been made.
-    void passWhileAway(bool arrives = false) {
+    void passWhileAway(bool arrives = false) { passWhileAway(alice, arrives); }
+    static void passWhileAway(Participant& user, bool arrives) {
         EverybodysKeys store(*world);
-        alice.wire->intercept([&store, arrives](const HttpRequest& request) -> std::optional<HttpResponse> {
+        user.wire->intercept([&store, arrives](const HttpRequest& request) -> std::optional<HttpResponse> {
             if (request.method != "PUT" && request.method != "DELETE" && request.method != "MKCOL" &&
                 request.method != "ACL")
                 return std::nullopt;
@@ -31,8 +32,23 @@ protected:
             failed.status = 503;
             return failed;
         });
-        alice.pass();
-        alice.wire->intercept({});
+        user.pass();
+        user.wire->intercept({});
+    }
+    static void passOffLine(Participant& user) {
+        user.network.reachable = false;
+        user.pass();
+        user.network.reachable = true;
+    }
+    CXGroupRef copyOf(const CXGroupRef& group) {
+        return std::dynamic_pointer_cast<CXGroup>(
+            bob.application->recordForUniqueId(cxUIDWithTableName(group->uniqueId(), kCXSubscribedGroupTable)));
+    }
+    // Bob's copies and Alice's contacts are equal after a few passes, and at rest.
+    void expectEqualInTheEnd() {
+        for (Participant* each : {&bob, &alice, &bob, &alice, &bob}) each->pass();
+        EXPECT_EQ(copies(), alice.view()) << log.text();
+        for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
     }
     // One pass of each is enough.
     void expectSentAsItIs() {
@@ -177,6 +193,59 @@ TEST_F(WaitedChanges, WhatWasMadeAndIsGoneLeavesNothingOnTheStore) {
     save();
     expectSentAsItIs();
     EXPECT_FALSE(std::filesystem::exists(fileOf(dora)));
+}
+
+// The same of a writer's, in somebody else's tree.
+TEST_F(WaitedChanges, WhatAWriterHasOnTheStoreAllTheSameIsUndoneThere) {
+    const CXGroupRef copy = copyOf(friends);
+    copy->setValue(Value("Bob's"), kCXGroupNameProperty);
+    copy->addMember(bob.copyOf(people[1]));
+    copy->removeMember(bob.copyOf(people[0]));
+    bob.application->save();
+    passWhileAway(bob, true);
+    copy->setValue(Value("Friends"), kCXGroupNameProperty);
+    copy->removeMember(bob.copyOf(people[1]));
+    copy->addMember(bob.copyOf(people[0]));
+    bob.application->save();
+    const auto meant = copies();
+    expectEqualInTheEnd();
+    EXPECT_EQ(copies(), meant) << log.text();
+}
+
+// Nothing of it was ever sent, so what the owner does meanwhile is news.
+TEST_F(WaitedChanges, WhatAWriterHasUndoneBeforeItWasSentDoesNotUndoTheOwnersChange) {
+    const CXGroupRef copy = copyOf(friends);
+    copy->setValue(Value("Bob's"), kCXGroupNameProperty);
+    copy->addMember(bob.copyOf(people[1]));
+    bob.application->save();
+    passOffLine(bob);
+    copy->setValue(Value("Friends"), kCXGroupNameProperty);
+    copy->removeMember(bob.copyOf(people[1]));
+    bob.application->save();
+    friends->setValue(Value("Alice's"), kCXGroupNameProperty);
+    friends->addMember(people[1]);
+    save();
+    alice.pass();
+    const auto meant = alice.view();
+    expectEqualInTheEnd();
+    EXPECT_EQ(alice.view(), meant) << log.text();
+}
+
+TEST_F(WaitedChanges, ADeletionThatAWriterTakesBackIsNotMade) {
+    const CXPersonRef copy = bob.copyOf(people[1]);
+    const Dictionary content = copy->dictionaryRepresentation();
+    const UniqueId uid = copy->uniqueId();
+    const auto meant = copies();
+    bob.application->removeRecord(copy);
+    bob.application->save();
+    passOffLine(bob);
+    const auto again = CXPerson::initWithUniqueId(uid);
+    bob.application->addRecord(again);
+    for (const auto& [property, value] : content) again->setValue(value, property);
+    copyOf(sub)->addMember(again);
+    bob.application->save();
+    expectEqualInTheEnd();
+    EXPECT_EQ(copies(), meant) << log.text();
 }
 
 } // namespace rolvane::test

@@ -222,7 +222,7 @@ TEST_P(RootsStore, EndsNoProgramOfRootsForANumberInTheServersFile) {
     store.start();
     store.stop();
     test::ChildProcess reader(
-        {"sh", "-c", "tail -n +1 -f \"$1\" & echo number $!; wait", "sh", state + "/conf/httpd.conf"});
+        {"sh", "-c", "tail -n +1 -f \"$1\" > /dev/null & echo number $!; wait", "sh", state + "/conf/httpd.conf"});
     const auto line = reader.waitForLine("^number ");
     ASSERT_TRUE(line);
     const std::string forged = state + "/run/httpd.pid", number = line->substr(7) + "\n";

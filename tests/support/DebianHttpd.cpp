@@ -192,11 +192,26 @@ void DebianHttpd::start() {
 
 std::string DebianHttpd::complaint() {
     writeSite();
-    ChildProcess child({.arguments = command(), .environment = environment(), .directory = "/"});
-    child.closeInput();
-    const auto ending = child.wait(20);
-    if (!ending || ending->exitedWith(0)) throw std::runtime_error("Debian's httpd has started");
-    return child.errors() + log();
+    for (int attempt = 0;; ++attempt) {
+        ChildProcess child({.arguments = command(), .environment = environment(), .directory = "/"});
+        child.closeInput();
+        const auto ending = child.wait(20);
+        if (!ending || ending->exitedWith(0)) throw std::runtime_error("Debian's httpd has started");
+        const std::string said = child.errors() + log();
+        if (attempt == 5 || said.find("Address already in use") == std::string::npos) return said;
+        moveToAnotherPort(); // somebody else has taken it meanwhile
+    }
+}
+
+void DebianHttpd::moveToAnotherPort() {
+    const std::string former = ":" + std::to_string(_port);
+    _port = LoopbackPort::choose();
+    for (const char* file :
+         {"apache2/ports.conf", "apache2/sites-available/000-default.conf", "apache2/apache2.conf"}) {
+        const std::string text = readFile(path(file));
+        std::ofstream(path(file)) << replaced(text, former, ":" + std::to_string(_port));
+    }
+    fs::remove(path("log/error.log"));
 }
 
 std::string DebianHttpd::log() const {

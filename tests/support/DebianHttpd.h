@@ -44,6 +44,7 @@ public:
     static std::string linesOfThePage(); // as they stand
 
 private:
+    void moveToAnotherPort(); // before a start
     std::vector<std::string> environment() const;
     std::string privatePaths(std::string lines) const;
     void run(std::vector<std::string> command) const;

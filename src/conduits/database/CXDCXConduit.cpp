@@ -146,27 +146,17 @@ void CXDCXConduit::addAllGroups(ChangeCapture& capture) {
     capture.addGroup(rolvane().allGroup());
 }
 
-std::optional<CXDChangeRecords> CXDCXConduit::changesOfGroupNow(const UserName& user, const UniqueId& uid) {
-    const std::shared_ptr<CXGroup> group = groupOfUser(user, uid);
+std::optional<CXDChangeRecords> CXDCXConduit::changesOfGroupNow(const UniqueId& uid) {
+    const std::shared_ptr<CXGroup> group =
+        uid.str() == kCXAllGroupUID
+            ? rolvane().allGroup()
+            : std::dynamic_pointer_cast<CXGroup>(rolvane().recordForUniqueId(cxUIDWithTableName(uid, kCXGroupTable)));
     ChangeCapture capture = newCapture();
     const auto location = group ? capture.reader().locationOfGroup(*group) : std::nullopt;
     // Of one that is shared nowhere by itself, as the all-contacts group where single groups are published.
-    if (!location || engine().userForRemoteLocation(*location) != user) return std::nullopt;
+    if (!location || engine().userForRemoteLocation(*location) != kSelf) return std::nullopt;
     capture.addGroup(group);
     return capture.take();
-}
-
-std::shared_ptr<CXGroup> CXDCXConduit::groupOfUser(const UserName& user, const UniqueId& uid) const {
-    if (uid.str() == kCXAllGroupUID) {
-        if (user == kSelf) return rolvane().allGroup();
-        for (const CXSubscriptionRef& subscription : rolvane().subscriptions())
-            if (const RemoteLocation location = subscription->remoteLocation();
-                subscription->_isAll() && engine().userForRemoteLocation(location) == user)
-                return saysSomething(*subscription) ? rolvane().allGroupForRemoteLocation(location) : nullptr;
-        return nullptr;
-    }
-    const std::string_view table = user == kSelf ? kCXGroupTable : kCXSubscribedGroupTable;
-    return std::dynamic_pointer_cast<CXGroup>(rolvane().recordForUniqueId(cxUIDWithTableName(uid, table)));
 }
 
 // The owner's tree has lost what it held: nothing of it counts as known any more, so that all of it is new.

@@ -98,7 +98,7 @@ public:
     CXDChangeRecords changeRecords() override;
 
     // The comparison that a scan makes of one group.
-    std::optional<CXDChangeRecords> changesOfGroupNow(const UserName& user, const UniqueId& group) override;
+    std::optional<CXDChangeRecords> changesOfGroupNow(const UniqueId& group) override;
 
     // Another process has saved. Hands the records to the engine in one trickle pass.
     void rolvaneChanged(const Notification& notification);
@@ -146,7 +146,6 @@ private:
     bool forgetWhatIsPublishedAgain(); // true: there is something
     bool saysSomething(const CXSubscription& subscription) const;
     void addAllGroups(ChangeCapture& capture);
-    std::shared_ptr<CXGroup> groupOfUser(const UserName& user, const UniqueId& group) const;
     void addUnsettledGroups(ChangeCapture& capture);
     void addUnsettledPeople(ChangeCapture& capture);
     const std::string& ownProgram() const;

@@ -129,6 +129,7 @@ void CXDVaultraConduit::open() {
     _world.manager.useVersionMemoryOf(database().databaseIdentity(), database().shareCount());
     _writes.giveUpMerged(); // of a pass that failed
     _setBack.clear();
+    _writtenInOrder.clear();
     _compared.clear(); // of a pass that failed
     _isOlderCopy = engine().conduitObjectForKey(kConduitCX, kPublishAgain)[kOlderCopy].boolean();
     const int code = testReachability(gathering ? [this] { beginReading(); } : std::function<void()>());
@@ -174,6 +175,7 @@ void CXDVaultraConduit::close() {
 }
 
 void CXDVaultraConduit::passWasStored() {
+    forgetWhatIsKnown();
     if (!_vaultraOffLine) _world.manager.saveVersionMemory(database().databaseIdentity(), database().shareCount());
 }
 

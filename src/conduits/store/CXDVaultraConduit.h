@@ -2,6 +2,7 @@
 
 #include "conduits/CXDConduit.h"
 #include "conduits/database/ContactWrites.h"
+#include "conduits/store/NewOnStore.h"
 #include "foundation/Notification.h"
 #include "store/dav/CXDAVManager.h"
 
@@ -14,6 +15,7 @@
 #include <set>
 #include <string>
 #include <unordered_map>
+#include <unordered_set>
 
 namespace rolvane {
 
@@ -76,6 +78,7 @@ public:
     CXDChangeRecords takeMerged() override;
     std::optional<Date> dateOfContact(const CXDChangeRecord& record) override;
     void willGather() override;
+    bool writesInOrder(const UserName& user) override;
     bool findsAgain(const CXDChangeRecord& record) const override;
     // A refused user name or password warns the person, at most once in 15 minutes, and ends the daemon. In a
     // gathering the structure of a tree of which nothing is known is looked after while the pass goes on; what needs it
@@ -148,6 +151,9 @@ private:
     bool somebodyMayWrite(); // besides the owner
     bool allGroupHas(const char* property);
     void compareUnlistedGroups(CXDChangeRecords& records);
+    void compareWhatHadCome(CXDChangeRecords& records);
+    std::vector<CXReached> whatHadCome();
+    void forgetWhatIsKnown();
     void leaveUnlistedOut(CXDChangeRecords& records);
     void forgetSubscribersRights();
     void noteUnsavedAccessLists();
@@ -165,6 +171,8 @@ private:
     bool createStructureForGroup(CXDChangeRecord& record, int& code);
     bool makeCompositeGroupChange(CXDChangeRecord& record, int& code);
     bool wasDeletedThere(CXDChangeRecord& record);
+    void noteNewRecords(const CXDChangeRecords& records);
+    bool writeComposite(CXDChangeRecord& record, const Dictionary& payload, int& code);
     Dictionary lastKnownState(const CXDChangeRecord& record);
     bool changeGroupName(CXDChangeRecord& record, int& code);
     bool addRecordToGroup(CXDChangeRecord& record, int& code);
@@ -175,6 +183,11 @@ private:
 
     World _world;
     ContactWrites _writes{_world.manager, _world.rolvane};
+    NewOnStore _newOnStore{_world.rolvane};
+    std::unordered_set<UserName> _writtenInOrder; // in the trees that were asked about; constant while a pass writes
+    std::unordered_set<UniqueId> _newRecords;     // in those trees, that no list is known to name; constant likewise
+    std::unordered_set<UniqueId> _lookedFor;      // among those that had come, by the last gathering; main thread
+    std::unordered_set<UniqueId> _inDoubt;        // had come and were not looked for; constant while a pass writes
     std::atomic<bool> _vaultraOffLine = false;
     std::atomic<bool> _isWrittenByOthers = false; // the own tree, as of the last open
     std::atomic<bool> _isOlderCopy = false;       // the own tree: it is older than the database

@@ -3,6 +3,7 @@
 #include "conduits/store/CXDVaultraConduit.h"
 
 #include "conduits/PublishedLayout.h"
+#include "conduits/store/TreeCondition.h"
 #include "contacts/database/CXRolvane.h"
 #include "contacts/records/Constants.h"
 #include "contacts/records/Identifier.h"
@@ -12,6 +13,7 @@
 #include "model/RemoteLocationMap.h"
 #include "store/dav/CXDAVManager.h"
 
+#include <algorithm>
 #include <utility>
 
 namespace rolvane {
@@ -20,6 +22,20 @@ namespace {
 constexpr int kOk = 200;
 constexpr int kForbidden = 403;
 constexpr int kMissing = 404;
+
+UniqueId groupInDatabase(const UserName& user, const UniqueId& group) {
+    return cxUIDWithTableName(group, user == kSelf ? kCXGroupTable : kCXSubscribedGroupTable);
+}
+
+// The contacts and groups that two lists of a group's change name, as the database names them.
+std::vector<UniqueId> namedIn(const UserName& user, const Dictionary& payload, const char* people, const char* groups) {
+    std::vector<UniqueId> named;
+    for (const Value& name : payload[people].array())
+        named.push_back(
+            cxUIDWithTableName(UniqueId(name.string()), user == kSelf ? kCXPersonTable : kCXSubscribedPersonTable));
+    for (const Value& name : payload[groups].array()) named.push_back(groupInDatabase(user, UniqueId(name.string())));
+    return named;
+}
 
 // The payload, decoded for this one use where it stands encoded: the record keeps no tree of it.
 Dictionary contentOf(CXDChangeRecord& record) {
@@ -92,6 +108,11 @@ bool CXDVaultraConduit::apply(CXDChangeRecord& record, int& code) {
 
 void CXDVaultraConduit::willWrite(const CXDChangeRecords& records) {
     _writes.beginPass();
+    _newOnStore.beginPass();
+    _inDoubt.clear();
+    for (const CXReached& each : whatHadCome())
+        if (!_lookedFor.contains(each.uniqueId)) _inDoubt.insert(each.uniqueId);
+    noteNewRecords(records);
     for (const CXDChangeRecordPtr& record : records) {
         if (record->type() != CXDUpdateRecord || !(record->appliesToSources() & conduitSource()) || !record->person() ||
             !record->user() || !mergesInto(*record->user()))
@@ -99,6 +120,25 @@ void CXDVaultraConduit::willWrite(const CXDChangeRecords& records) {
         if (const auto base = baseLocationOf(*record))
             _writes.willWrite(layout::contactLocation(*base, *record->person()), inDatabase(*record),
                               [&] { return contentOf(*record); });
+    }
+}
+
+// A record that the list names already can only be deleted there by being taken out of it.
+void CXDVaultraConduit::noteNewRecords(const CXDChangeRecords& records) {
+    _newRecords.clear();
+    const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
+    std::map<UserName, ListedNames> people;
+    for (const UserName& user : _writtenInOrder)
+        people.try_emplace(user, users[user.str()].dictionary(), kMemberUIDState);
+    for (const CXDChangeRecordPtr& record : records) {
+        const auto listed = record->user() ? people.find(*record->user()) : people.end();
+        if (listed == people.end()) continue;
+        if (record->type() == CXDUpdateRecord && record->person() &&
+            !listed->second.contains(cxNormalizedUID(*record->person())))
+            _newRecords.insert(inDatabase(*record));
+        if (record->group() && !users[record->user()->str()].dictionary().contains(
+                                   cxUIDWithTableName(*record->group(), kCXGroupTable).str()))
+            _newRecords.insert(groupInDatabase(*record->user(), *record->group()));
     }
 }
 
@@ -112,7 +152,9 @@ bool CXDVaultraConduit::updateRecord(CXDChangeRecord& record, int& code) {
             const Dictionary list = engine().knownGroupState(kConduitVaultra, user, everybody);
             return list[kMemberUIDState].array().containsString(shared.str());
         }};
-    return _writes.write(place, contentOf(record), code);
+    if (_inDoubt.contains(place.uniqueId) || !_writes.write(place, contentOf(record), code)) return false;
+    if (_newRecords.contains(place.uniqueId)) _newOnStore.wasPut(user, place.uniqueId, _world.clock.now());
+    return true;
 }
 
 // A shared identifier means the owner's own contact in the own tree, and in another one the copy that came from there,
@@ -154,13 +196,43 @@ std::optional<Date> CXDVaultraConduit::dateOfContact(const CXDChangeRecord& reco
 bool CXDVaultraConduit::createStructureForGroup(CXDChangeRecord& record, int& code) {
     const auto base = baseLocationOf(record);
     if (!base || !record.group()) return false;
+    const UserName user = record.user().value_or(UserName());
+    const UniqueId here = groupInDatabase(user, *record.group());
+    if (_inDoubt.contains(here)) return false;
     // Whether the directory could be made shows in the write below it.
     _world.manager.createDirectoryAtAURL(layout::groupLocation(*base, *record.group()));
-    return _world.manager.write(stringForDictionary(contentOf(record)),
-                                layout::groupInfoLocation(*base, *record.group()), kSecureRecordWrites, &code);
+    const bool done =
+        _world.manager.write(stringForDictionary(contentOf(record)), layout::groupInfoLocation(*base, *record.group()),
+                             kSecureRecordWrites, &code);
+    if (done && _newRecords.contains(here)) _newOnStore.wasPut(user, here, _world.clock.now());
+    return done;
 }
 
 bool CXDVaultraConduit::makeCompositeGroupChange(CXDChangeRecord& record, int& code) {
+    if (!record.user() || !record.group() || !_writtenInOrder.contains(*record.user()))
+        return writeComposite(record, contentOf(record), code);
+    const Dictionary payload = contentOf(record);
+    const std::vector<UniqueId> named = namedIn(*record.user(), payload, kMemberAdds, kSubgroupAdds);
+    const bool isList = record.group()->str() == layout::kAllGroup;
+    const auto waits = [&](const UniqueId& uid) {
+        return _inDoubt.contains(uid) || (!isList && _newOnStore.waitsForList(uid));
+    };
+    const UniqueId here = groupInDatabase(*record.user(), *record.group());
+    std::vector<UniqueId> ofList;
+    if (isList) {
+        ofList = namedIn(*record.user(), payload, kMemberRemoves, kSubgroupRemoves);
+        ofList.insert(ofList.end(), named.begin(), named.end());
+        _newOnStore.listWaits(ofList);
+    }
+    if (waits(here) || std::any_of(named.begin(), named.end(), waits)) return false;
+    if (isList) _newOnStore.willName(*record.user(), named, _world.clock.now());
+    if (!writeComposite(record, payload, code)) return false;
+    _newOnStore.listWasWritten(ofList);
+    if (_newRecords.contains(here)) _newOnStore.wasPut(*record.user(), here, _world.clock.now());
+    return true;
+}
+
+bool CXDVaultraConduit::writeComposite(CXDChangeRecord& record, const Dictionary& payload, int& code) {
     const auto base = baseLocationOf(record);
     if (!base || !record.group()) return false;
     const Url location = layout::groupLocation(*base, *record.group());
@@ -172,13 +244,22 @@ bool CXDVaultraConduit::makeCompositeGroupChange(CXDChangeRecord& record, int& c
     }
     // A part alone would be taken for all of it.
     if (!state && (code == kMissing || code == kOk)) state = lastKnownState(record);
-    const Dictionary changed = layout::groupStateAfterComposite(state.value_or(Dictionary()), contentOf(record));
+    const Dictionary changed = layout::groupStateAfterComposite(state.value_or(Dictionary()), payload);
     // A state that is there and could not be read is not replaced by a part of it: the client then sends no write, and
     // the answer to the read stands.
     int written = 0;
     const bool done = _world.manager.write(stringForDictionary(changed), location, kSecureRecordWrites, &written);
     code = written != 0 ? written : cxAfterQuestion(_world.manager, *base, code);
     return done;
+}
+
+// Somebody else may take a new record in and delete it again. Nobody does before a tree's first list.
+bool CXDVaultraConduit::writesInOrder(const UserName& user) {
+    const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
+    const bool answer =
+        mergesInto(user) && !users[user.str()].dictionary()[std::string(layout::kAllGroup)].dictionary().empty();
+    if (answer) _writtenInOrder.insert(user);
+    return answer;
 }
 
 // A group that is known and whose state is gone, asked twice: somebody else who may write has deleted it, and a part of
@@ -226,13 +307,14 @@ bool CXDVaultraConduit::addRecordToGroup(CXDChangeRecord& record, int& code) {
 
 bool CXDVaultraConduit::deleteRecord(CXDChangeRecord& record, int& code) {
     const auto base = baseLocationOf(record);
-    if (!base || !record.person()) return false;
+    if (!base || !record.person() || _newOnStore.waitsForList(inDatabase(record))) return false;
     return _world.manager.removeFileAtURL(layout::contactLocation(*base, *record.person()), &code);
 }
 
 bool CXDVaultraConduit::deleteGroup(CXDChangeRecord& record, int& code) {
     const auto base = baseLocationOf(record);
     if (!base || !record.group()) return false;
+    if (_newOnStore.waitsForList(groupInDatabase(record.user().value_or(UserName()), *record.group()))) return false;
     return _world.manager.removeFileAtURL(layout::groupLocation(*base, *record.group()), &code);
 }
 

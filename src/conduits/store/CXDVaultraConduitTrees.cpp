@@ -3,6 +3,7 @@
 
 #include "conduits/store/CXDVaultraConduit.h"
 
+#include "conduits/PublishedLayout.h"
 #include "conduits/store/EndedPublication.h"
 #include "conduits/store/StoreComparison.h"
 #include "conduits/store/TreeCondition.h"
@@ -10,6 +11,7 @@
 #include "contacts/database/DamagedDatabase.h"
 #include "contacts/records/Constants.h"
 #include "contacts/records/Identifier.h"
+#include "foundation/CXException.h"
 #include "foundation/Log.h"
 #include "foundation/Preferences.h"
 #include "model/PayloadKeys.h"
@@ -25,6 +27,20 @@ namespace {
 
 // In the prior state of the owner's tree: something was amiss there that may be so for a moment only.
 constexpr const char* kLookAgain = "LookAgain";
+
+// People and groups of a tree's list of everybody.
+class ListedRecords {
+public:
+    explicit ListedRecords(const Dictionary& state)
+        : _people(state, kMemberUIDState), _groups(state, kSubgroupUIDState) {}
+    bool contains(const UniqueId& record) const {
+        const UniqueId shared = cxNormalizedUID(record);
+        return _people.contains(shared) || _groups.contains(shared);
+    }
+
+private:
+    const ListedNames _people, _groups;
+};
 
 } // namespace
 
@@ -78,7 +94,7 @@ bool CXDVaultraConduit::isBeingMended() {
 std::optional<CXDVaultraConduit::Comparison> CXDVaultraConduit::comparisonWith(const UserName& user, const Url& base,
                                                                                bool ask) {
     const auto states = engine().stateGeneration();
-    if (!states ||
+    if (!states || !_world.rolvane.reached().empty() ||
         (user == kSelf && (isBeingMended() || !engine().conduitObjectForKey(kConduitCX, kPublishAgain).empty())))
         return std::nullopt;
     const auto tree = _world.manager.markOfTree(base, ask);
@@ -211,6 +227,7 @@ CXDChangeRecords CXDVaultraConduit::changeRecords() {
         if (record->user()) changed.insert(*record->user());
     leaveUnlistedOut(records);
     compareUnlistedGroups(records);
+    compareWhatHadCome(records);
     for (const CXDChangeRecords* some : {&records, &_leftovers})
         for (const CXDChangeRecordPtr& record : *some)
             if (record->user()) changed.insert(*record->user());
@@ -242,6 +259,60 @@ void CXDVaultraConduit::compareUnlistedGroups(CXDChangeRecords& records) {
         if (user != kSelf) continue;
         for (CXDChangeRecordPtr& removal : removalOfUnlistedGroups(prior, state, isHere))
             records.push_back(std::move(removal));
+    }
+}
+
+// New contacts and groups that a killed pass has put there, in lists and all. Those that are nowhere any more have been
+// deleted by somebody, and leave the database, too. A leftover that its owner has taken away for want of a name is
+// written again.
+void CXDVaultraConduit::compareWhatHadCome(CXDChangeRecords& records) {
+    const std::vector<CXReached> reached = whatHadCome();
+    _lookedFor.clear();
+    if (reached.empty()) return;
+    const UniqueId everybody{std::string(layout::kAllGroup)};
+    for (const auto& [user, state] : _read) {
+        std::vector<UniqueId> names;
+        for (const CXReached& each : reached)
+            if (each.tree == user) {
+                names.push_back(cxNormalizedUID(each.uniqueId));
+                _lookedFor.insert(each.uniqueId);
+            }
+        if (!mergesInto(user)) continue;
+        for (const UniqueId& name : namesThatAreNowhere(state, names)) {
+            const auto type = name.endsWith(kCXGroupTable) ? CXDRemoveGroupFromGroup : CXDRemoveRecordFromGroup;
+            auto removal = std::make_shared<CXDChangeRecord>(conduitSource(), type, user, name, everybody);
+            removal->setAppliesToSources(CXDSyncSourceCX);
+            CXDLog("It had come, and was deleted since: %@", removal);
+            records.push_back(std::move(removal));
+        }
+    }
+}
+
+// Without those that the states know by now, and those that a leftover's time is over for.
+std::vector<CXReached> CXDVaultraConduit::whatHadCome() {
+    std::vector<CXReached> reached = _world.rolvane.reached();
+    if (reached.empty()) return reached;
+    const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
+    std::map<UserName, ListedRecords> known;
+    std::erase_if(reached, [&](const CXReached& each) {
+        return _world.clock.now().secondsSince(each.since) >= kPatience ||
+               known.try_emplace(each.tree, users[each.tree.str()].dictionary()).first->second.contains(each.uniqueId);
+    });
+    return reached;
+}
+
+void CXDVaultraConduit::forgetWhatIsKnown() {
+    const std::vector<CXReached> reached = _world.rolvane.reached();
+    if (reached.empty()) return;
+    std::unordered_set<UniqueId> unknown;
+    for (const CXReached& each : whatHadCome()) unknown.insert(each.uniqueId);
+    std::vector<UniqueId> needless;
+    for (const CXReached& each : reached)
+        if (!unknown.contains(each.uniqueId)) needless.push_back(each.uniqueId);
+    try {
+        _world.rolvane.forgetReached(needless);
+    } catch (const CXException& exception) {
+        CXLog("Notes of new records are kept until the next pass: %@", exception);
     }
 }
 

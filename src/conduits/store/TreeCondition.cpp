@@ -298,6 +298,22 @@ std::vector<UniqueId> contactsThatAreUnlisted(const Dictionary& current, const s
     return unlisted;
 }
 
+std::vector<UniqueId> namesThatAreNowhere(const Dictionary& current, const std::vector<UniqueId>& names) {
+    if (names.empty() || !current[kEverybody].dictionary()[kMemberUIDState].isArray()) return {};
+    const Dictionary files = current[kPeopleState].dictionary()[kMemberUIDState].dictionary();
+    std::unordered_set<std::string_view> named; // the state keeps the texts
+    for (const auto& [group, state] : current)
+        if (isGroup(group))
+            for (const char* list : {kMemberUIDState, kSubgroupUIDState})
+                for (const Value& name : state.dictionary()[list].array())
+                    if (const std::string* text = name.stringIf()) named.insert(*text);
+    std::vector<UniqueId> nowhere;
+    for (const UniqueId& name : names)
+        if (!files.contains(name.str()) && !current.contains(name.str()) && !named.contains(name.str()))
+            nowhere.push_back(name);
+    return nowhere;
+}
+
 CXDChangeRecordPtr removalOfContact(const UniqueId& person) {
     return ownersChange(CXDDeleteRecord, person, std::nullopt);
 }

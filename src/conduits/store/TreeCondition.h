@@ -106,6 +106,10 @@ std::vector<UniqueId> contactsThatAreUnlisted(const Dictionary& current, const s
 // The change that takes one contact off the store.
 CXDChangeRecordPtr removalOfContact(const UniqueId& person);
 
+// Those of the names, of contacts and groups, that the tree has neither a file of nor in any list. None while the list
+// of everybody is not there.
+std::vector<UniqueId> namesThatAreNowhere(const Dictionary& current, const std::vector<UniqueId>& names);
+
 // The contacts that the list of everybody names and that are nowhere in the tree. Looks at nothing but two counts while
 // none is missing and none is there besides.
 std::vector<UniqueId> contactsThatAreMissing(const Dictionary& current);

@@ -35,8 +35,9 @@ CXRolvane::Impl::Impl(CXRolvane& owner, Options given)
       center(options.center ? *options.center : NotificationCenter::defaultCenter()),
       sqlite(RecordStore::makeIfMissing(options.path, options.busyTimeoutMilliseconds),
              options.busyTimeoutMilliseconds),
-      store(sqlite), journal(sqlite), commonVersions(sqlite), conflicts(sqlite), formerVersions(sqlite),
-      changeLog(sqlite), identity(store.identity()), anchor(std::make_shared<CXRolvane* const>(&owner)) {}
+      store(sqlite), journal(sqlite), commonVersions(sqlite), reachedStore(sqlite), conflicts(sqlite),
+      formerVersions(sqlite), changeLog(sqlite), identity(store.identity()),
+      anchor(std::make_shared<CXRolvane* const>(&owner)) {}
 
 CXRolvane::CXRolvane(Options options) : _impl(std::make_unique<Impl>(*this, std::move(options))) {
     if (!_impl->options.runLoop) return;

@@ -2,6 +2,7 @@
 
 #include "contacts/database/CommonVersions.h"
 #include "contacts/database/ConflictLog.h"
+#include "contacts/database/ReachedStore.h"
 #include "contacts/records/CXAllGroup.h"
 #include "contacts/records/CXGroup.h"
 #include "contacts/records/CXPerson.h"
@@ -191,6 +192,11 @@ public:
     // version is set, whatever becomes of the process. Part of the unit of work. Any thread.
     void setSentVersion(const UniqueId& uid, std::shared_ptr<const Bytes> properties);
     std::vector<UniqueId> editedSinceCommon(); // contacts with edits that were not sent, oldest first
+    // New records that a store has now, whatever becomes of the pass that put them there. Durable on return; of records
+    // that are saved. Any thread.
+    void noteReachedAtOnce(const std::vector<CXReached>& reached);
+    std::vector<CXReached> reached();
+    void forgetReached(const std::vector<UniqueId>& records); // durable on return
     // Values that gave way to others: noted with the next save, or durably on return.
     void noteConflicts(const UniqueId& uid, const std::vector<CXMergeConflict>& conflicts);
     void noteConflictsAtOnce(const UniqueId& uid, const std::vector<CXMergeConflict>& conflicts); // any thread

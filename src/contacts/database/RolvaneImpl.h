@@ -7,6 +7,7 @@
 #include "contacts/database/ConflictLog.h"
 #include "contacts/database/FormerVersions.h"
 #include "contacts/database/Journal.h"
+#include "contacts/database/ReachedStore.h"
 #include "contacts/database/RecordStore.h"
 #include "contacts/database/SharedForms.h"
 #include "contacts/database/UnitOfWork.h"
@@ -30,6 +31,7 @@ struct CXRolvane::Impl {
     RecordStore store;
     Journal journal;
     CommonVersions commonVersions;
+    ReachedStore reachedStore;
     ConflictLog conflicts;
     FormerVersions formerVersions;
     ChangeLog changeLog;

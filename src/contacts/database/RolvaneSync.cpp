@@ -79,6 +79,27 @@ std::vector<UniqueId> CXRolvane::editedSinceCommon() {
     return _impl->commonVersions.edited();
 }
 
+void CXRolvane::noteReachedAtOnce(const std::vector<CXReached>& reached) {
+    if (reached.empty()) return;
+    std::lock_guard lock(_impl->mutex);
+    SqliteTransaction transaction(_impl->sqlite);
+    for (const CXReached& each : reached) _impl->reachedStore.note(each);
+    transaction.commit();
+}
+
+std::vector<CXReached> CXRolvane::reached() {
+    std::lock_guard lock(_impl->mutex);
+    return _impl->reachedStore.all();
+}
+
+void CXRolvane::forgetReached(const std::vector<UniqueId>& records) {
+    if (records.empty()) return;
+    std::lock_guard lock(_impl->mutex);
+    SqliteTransaction transaction(_impl->sqlite);
+    for (const UniqueId& uid : records) _impl->reachedStore.forget(uid);
+    transaction.commit();
+}
+
 namespace {
 
 std::vector<CXConflict> dated(CXRolvane::Impl& database, const UniqueId& uid,

@@ -175,6 +175,7 @@ void ApplyLoop::queue() {
     CXDChangeRecords flat = flattenGroupChanges(accepted, &lost);
     _recovery.lostInFolds(lost);
     sortByType(flat);
+    putListsOfEverybodyFirst(flat);
     _totalCount = flat.size();
     _processedCount = 0;
     CXDLog("Flat: %@", flat);

@@ -33,7 +33,8 @@ int64_t configuredWorkers(const NetworkAccount& account) {
 }
 
 OutOfOrderWork::OutOfOrderWork(EngineParts& parts, CXDChangeRecords records)
-    : _parts(parts), _turns(records), _outOfOrderLock(records.empty() ? 1 : 0),
+    : _parts(parts), _turns(records, [&](const UserName& user) { return parts.conduits.vaultra->writesInOrder(user); }),
+      _outOfOrderLock(records.empty() ? 1 : 0),
       _records(std::make_move_iterator(records.begin()), std::make_move_iterator(records.end())),
       _changeCount(_records.size()) {}
 
@@ -96,9 +97,16 @@ void OutOfOrderWork::outOfOrderWorkLoop() {
         const CXDChangeRecordPtr record = std::move(_records.front());
         _records.pop_front();
         const bool last = _records.empty();
+        const bool waits = _turns.waitsForList(*record);
+        if (waits) _waiting.insert(record);
         _outOfOrderLock.unlockWithCondition(0);
 
         _turns.await(*record);
+        if (waits) {
+            _outOfOrderLock.lock();
+            _waiting.erase(record);
+            _outOfOrderLock.unlock();
+        }
         const int32_t wanted = record->appliesToSources();
         const int32_t applied = _parts.terminating ? 0 : apply(record, denied);
         if (applied != wanted || record.use_count() > 1) record->packPayload(); // somebody keeps it
@@ -157,9 +165,11 @@ void OutOfOrderWork::cancelLike(const CXDChangeRecordPtr& record) {
     CXDChangeRecords waiting;
     if (record->user()) {
         _outOfOrderLock.lock();
-        if (_cancelledUsers.insert(*record->user()).second)
-            std::copy_if(_records.begin(), _records.end(), std::back_inserter(waiting),
-                         [&](const CXDChangeRecordPtr& each) { return each->user() == record->user(); });
+        if (_cancelledUsers.insert(*record->user()).second) {
+            const auto isLike = [&](const CXDChangeRecordPtr& each) { return each->user() == record->user(); };
+            std::copy_if(_records.begin(), _records.end(), std::back_inserter(waiting), isLike);
+            std::copy_if(_waiting.begin(), _waiting.end(), std::back_inserter(waiting), isLike);
+        }
         _outOfOrderLock.unlock();
     }
     _parts.denied.cancelLike(record, waiting);

@@ -52,9 +52,10 @@ private:
     EngineParts& _parts;
     RecordTurns _turns;
     ConditionLock _outOfOrderLock;
-    std::deque<CXDChangeRecordPtr> _records;      // guarded by _outOfOrderLock
-    std::unordered_set<UserName> _cancelledUsers; // guarded by _outOfOrderLock
-    size_t _processedCount = 0;                   // guarded by _outOfOrderLock
+    std::deque<CXDChangeRecordPtr> _records;         // guarded by _outOfOrderLock
+    std::unordered_set<CXDChangeRecordPtr> _waiting; // for a list, in a worker's hands; guarded by _outOfOrderLock
+    std::unordered_set<UserName> _cancelledUsers;    // guarded by _outOfOrderLock
+    size_t _processedCount = 0;                      // guarded by _outOfOrderLock
     const size_t _changeCount;
     std::mutex _processedChangesLock;
     CXDChangeRecords _pending; // guarded by _processedChangesLock

@@ -1,5 +1,7 @@
 #include "engine/pass/RecordTurns.h"
 
+#include "engine/queue/ChangeQueue.h"
+
 #include <functional>
 
 namespace rolvane {
@@ -21,9 +23,19 @@ struct TargetHash {
     }
 };
 
+bool isContact(const CXDChangeRecord& record) {
+    return record.type() == CXDUpdateRecord || record.type() == CXDCreateStructureForGroup;
+}
+
+bool comesBehindTheList(const CXDChangeRecord& record) {
+    return (record.type() == CXDCompositeGroupChange && !isListOfEverybody(record)) ||
+           record.type() == CXDDeleteRecord || record.type() == CXDDeleteGroup;
+}
+
 } // namespace
 
-RecordTurns::RecordTurns(const CXDChangeRecords& records) {
+RecordTurns::RecordTurns(const CXDChangeRecords& records, const std::function<bool(const UserName&)>& inOrder) {
+    if (inOrder) order(records, inOrder);
     std::unordered_map<Target, const CXDChangeRecord*, TargetHash> latest;
     latest.reserve(records.size());
     for (const CXDChangeRecordPtr& record : records) {
@@ -35,12 +47,50 @@ RecordTurns::RecordTurns(const CXDChangeRecords& records) {
     }
 }
 
+void RecordTurns::order(const CXDChangeRecords& records, const std::function<bool(const UserName&)>& inOrder) {
+    struct Seen {
+        size_t contacts = 0;
+        bool other = false;
+    };
+    std::unordered_map<UserName, Seen> seen;
+    for (const CXDChangeRecordPtr& record : records) {
+        if (!record->user()) continue;
+        Seen& before = seen[*record->user()];
+        if (isContact(*record)) ++before.contacts;
+        if (comesBehindTheList(*record)) before.other = true;
+        if (!isListOfEverybody(*record) || _trees.contains(*record->user()) || !inOrder(*record->user())) continue;
+        Tree& tree = *_trees.emplace(*record->user(), std::make_unique<Tree>()).first->second;
+        tree.contacts = before.contacts;
+        tree.lists = before.other ? 0 : 1; // nobody waits for one that is behind
+    }
+}
+
+RecordTurns::Tree* RecordTurns::treeOf(const CXDChangeRecord& record) const {
+    if (_trees.empty() || !record.user()) return nullptr;
+    const auto found = _trees.find(*record.user());
+    return found == _trees.end() ? nullptr : found->second.get();
+}
+
+bool RecordTurns::waitsForList(const CXDChangeRecord& record) const {
+    return comesBehindTheList(record) && treeOf(record);
+}
+
 void RecordTurns::await(const CXDChangeRecord& record) const {
+    if (Tree* tree = isListOfEverybody(record) || comesBehindTheList(record) ? treeOf(record) : nullptr) {
+        std::unique_lock guard(tree->lock);
+        const size_t& before = isListOfEverybody(record) ? tree->contacts : tree->lists;
+        tree->changed.wait(guard, [&] { return before == 0; });
+    }
     const auto turn = _turns.find(&record);
     if (turn != _turns.end() && turn->second.before) turn->second.before->wait();
 }
 
 void RecordTurns::done(const CXDChangeRecord& record) {
+    if (Tree* tree = isContact(record) || isListOfEverybody(record) ? treeOf(record) : nullptr) {
+        const std::lock_guard guard(tree->lock);
+        size_t& left = isContact(record) ? tree->contacts : tree->lists;
+        if (left > 0 && --left == 0) tree->changed.notify_all();
+    }
     const auto turn = _turns.find(&record);
     if (turn != _turns.end()) turn->second.own->count_down();
 }

@@ -1,5 +1,7 @@
 #include "engine/queue/ChangeQueue.h"
 
+#include "contacts/records/Identifier.h"
+
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
 
@@ -173,6 +175,18 @@ void sortByType(CXDChangeRecords& records) {
         byType[static_cast<uint32_t>(record->type())].push_back(std::move(record));
     records.clear();
     for (auto& [type, all] : byType) std::move(all.begin(), all.end(), std::back_inserter(records));
+}
+
+bool isListOfEverybody(const CXDChangeRecord& record) {
+    return record.type() == CXDCompositeGroupChange && record.group() &&
+           cxUIDWithTableName(*record.group(), kCXGroupTable).str() == kCXAllGroupUID;
+}
+
+void putListsOfEverybodyFirst(CXDChangeRecords& sorted) {
+    const auto isComposite = [](const CXDChangeRecordPtr& record) { return record->type() == CXDCompositeGroupChange; };
+    const auto first = std::find_if(sorted.begin(), sorted.end(), isComposite);
+    std::stable_partition(first, std::find_if_not(first, sorted.end(), isComposite),
+                          [](const CXDChangeRecordPtr& record) { return isListOfEverybody(*record); });
 }
 
 } // namespace rolvane

@@ -31,5 +31,10 @@ CXDChangeRecords flattenGroupChanges(const CXDChangeRecords& records, LostInFold
 
 // Sorts by CXDChangeRecord::compare; equal ones keep their order. O(C).
 void sortByType(CXDChangeRecords& records);
+// True of a change of the list of everybody, in whatever tree, that joins several.
+bool isListOfEverybody(const CXDChangeRecord& record);
+// Of sorted ones: changes of lists of everybody go before those of other groups. A contact that a group names and that
+// list does not is half a contact. The order is kept otherwise. O(C).
+void putListsOfEverybodyFirst(CXDChangeRecords& sorted);
 
 } // namespace rolvane

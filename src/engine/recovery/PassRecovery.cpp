@@ -9,6 +9,8 @@
 #include "model/PayloadKeys.h"
 #include "model/RemoteLocationMap.h"
 
+#include <algorithm>
+#include <iterator>
 #include <unordered_set>
 
 namespace rolvane {
@@ -17,6 +19,7 @@ namespace {
 
 // Groups in other users' trees: their waiting changes are sent as they are, and the next scan compares the groups.
 Dictionary unsettledOfOthers(const CXDChangeRecords& records, size_t fresh) {
+    if (records.size() <= fresh) return {}; // nothing waited
     CXDChangeRecords others;
     size_t freshOthers = 0;
     for (size_t i = 0; i < records.size(); ++i)
@@ -34,7 +37,7 @@ void PassRecovery::begin(CXDChangeRecords& records, size_t fresh) {
     _underWay = underWayInAnyForm(_parts.state.underWay());
     _unsettled = unsettledOfOthers(records, fresh);
     const CXDChangeRecords before = restatement().restate(records, fresh);
-    _underWay = underWayTogether(*_underWay, withSubscriptions(listsUnderWay(before)));
+    _underWay = underWayTogether(*_underWay, listsUnderWay(before));
     settle(records);
 }
 
@@ -89,11 +92,26 @@ void PassRecovery::noteUnsure(const UniqueId& group) {
 }
 
 bool PassRecovery::end(const CXDChangeRecords& left) {
+    if (!_parts.vaultraOffLine()) _end.unread = underWayTogether(_end.unread, mayHaveArrived(left));
     _end.unsureGroups.merge(groupsOf(ownWrites(left)));
     _end.everythingIsPublished = isPublished(*_parts.with.rolvane.allGroup());
     if (_unsettled.empty() || isLeftOut("unsettled groups")) return false;
     _parts.state.conduitObjectForKey(kConduitCX, kUnsettledGroups).addEntriesFrom(_unsettled);
     return true;
+}
+
+// Of what waits in other users' trees: the answers may have been lost, and not the changes.
+Dictionary PassRecovery::mayHaveArrived(const CXDChangeRecords& left) const {
+    if (isLeftOut("may have arrived")) return {};
+    CXDChangeRecords ofGroups;
+    std::copy_if(left.begin(), left.end(), std::back_inserter(ofGroups), [](const CXDChangeRecordPtr& record) {
+        return record->user() != kSelf && record->type() != CXDUpdateRecord;
+    });
+    const Dictionary all = withSubscriptions(underWay(ofGroups));
+    Dictionary subscribed;
+    for (const auto& [user, of] : all)
+        if (of.dictionary().contains(kSubscription)) subscribed.set(user, of);
+    return subscribed;
 }
 
 void PassRecovery::storeNote() {

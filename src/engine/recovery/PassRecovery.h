@@ -45,6 +45,7 @@ private:
     std::function<bool(const UserName&)> hasCopies() const;
     Restatement restatement() const;
     Dictionary withSubscriptions(Dictionary underWay) const;
+    Dictionary mayHaveArrived(const CXDChangeRecords& left) const;
     std::vector<std::pair<UserName, CXSubscriptionRef>> subscriptionsOf(const Dictionary& underWay) const;
     void noteUnsure(const UniqueId& group); // one of the owner's
 

@@ -17,8 +17,10 @@ class CXRolvane;
 // Content of a contact that has left the database becomes the contact's removal, and any change of such a group the
 // group's: nothing that is known of the store would ever take away what such a change puts there, or has put there
 // before its answer was lost. Whoever was to be put into a group is taken out of it and removed. The removal of a
-// contact or group that is in the database again (an undone deletion, an imported card) is dropped. All other changes
-// of an own group give way to one comparison of the group with what is known of its store.
+// contact or group that is in the database again (an undone deletion, an imported card) is dropped; of a copy, where a
+// person has made it again. All other changes of an own group give way to one comparison of the group with what is
+// known of its store. Of a group in a writer's copies, which may be older than that store, only those parts are dropped
+// that the person has taken back.
 struct Restatement {
     CXRolvane& rolvane;
     CXDConduit& database;                                // the contact database's
@@ -31,8 +33,11 @@ struct Restatement {
     // The same but for the comparison of groups.
     void withdrawWhatIsGone(CXDChangeRecords& records, size_t fresh) const;
     void dropRemovalsOfWhatIsBack(CXDChangeRecords& records, size_t fresh) const;
+    // Of groups in a writer's copies, whose other changes are sent as they are.
+    void dropWhatAWriterUndid(CXDChangeRecords& records, size_t fresh) const;
 
 private:
+    bool isCopyMadeAgain(const UniqueId& person) const; // by somebody at this computer
     CXDChangeRecords compareGroups(CXDChangeRecords& records, size_t fresh) const;
 };
 

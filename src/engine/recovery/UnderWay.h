@@ -46,7 +46,7 @@ struct PassEnd {
     std::unordered_set<UniqueId> removed;      // people and groups that it took from the store, or has still to take
     std::unordered_set<UniqueId> unsureGroups; // whose changes wait, or may have been lost
     bool everythingIsPublished = false;        // and not single groups only
-    Dictionary unread;                         // under way in trees that were not read
+    Dictionary unread;                         // under way in trees that were not read, or whose changes wait
 };
 std::unordered_set<UniqueId> removedBy(const CXDChangeRecords& records);
 bool isOwnWrite(const CXDChangeRecord& record); // of the owner's, to the network store

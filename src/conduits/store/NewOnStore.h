@@ -1,0 +1,42 @@
+#pragma once
+
+#include "contacts/database/CXRolvane.h"
+
+#include <mutex>
+#include <unordered_set>
+#include <vector>
+
+namespace rolvane {
+
+// Notes the new contacts and groups that other people may take in before the pass has come to its end: those with a
+// file on the store and a name in the list of everybody. Somebody may delete such a record at once. A pass that was
+// killed would otherwise be made again, and bring the record back.
+//
+// A contact's file comes before its name, and the note is durable before the name is written. A group's file follows
+// its name; a process that is killed between that file and its note leaves none. Any thread.
+class NewOnStore {
+public:
+    explicit NewOnStore(CXRolvane& rolvane) : _rolvane(rolvane) {} // borrowed
+
+    void beginPass(); // of names alone nothing is known any more
+    // The store has the new record's file. `record`: as the database names it; `tree`: whose it is.
+    void wasPut(const UserName& tree, const UniqueId& record, Date now);
+    // The list of everybody is about to name them. Throws CXException where the note cannot be stored.
+    void willName(const UserName& tree, const std::vector<UniqueId>& records, Date now);
+    // The list is to name them, or to name them no longer. Until it is written, new groups among them have to wait,
+    // groups that name one of them, and deletions: whoever reads half a record would list it, or take it for lost.
+    void listWaits(const std::vector<UniqueId>& records);
+    void listWasWritten(const std::vector<UniqueId>& records);
+    bool waitsForList(const UniqueId& record); // in this pass
+
+private:
+    void note(const std::vector<CXReached>& reached);
+
+    CXRolvane& _rolvane;
+    std::mutex _lock;
+    std::unordered_set<UniqueId> _put;     // without a name, of all passes of this process; guarded by _lock
+    std::unordered_set<UniqueId> _named;   // without a file, of this pass; guarded by _lock
+    std::unordered_set<UniqueId> _waiting; // for the list, in this pass; guarded by _lock
+};
+
+} // namespace rolvane
