@@ -50,7 +50,8 @@ void refuseForeignStep(const FileHandle& directory, const std::string& path) {
              "start the store as the user whom that directory belongs to.");
 }
 
-// Whoever may rename things in the directory of the documents could put a link in the place of the trees later.
+// Another user who may rename things in the directory of the documents could put a link in the place of the trees
+// later.
 void refuseForeignDocuments(const FileHandle& documents, const std::string& path, const StoreIdentity& server) {
     const struct stat info = statusOf(documents, path);
     if (info.st_uid != 0 && info.st_uid != server.uid)

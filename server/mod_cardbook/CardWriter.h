@@ -8,7 +8,8 @@
 
 namespace rolvane::cardbook {
 
-// What a request asks of the card that it changes (RFC 9110 section 13.1). All of it was judged once, before the body.
+// The conditions of a request on the card that it changes (RFC 9110 section 13.1). All of it was judged once, before
+// the body.
 struct Conditions {
     bool namesTag = false; // If-Match with tags, one of which the card had: the client has had that version
     bool exists = false;   // If-Match: *

@@ -99,7 +99,7 @@ void CXRolvane::Impl::replaceProperties(const UniqueId& uid, Dictionary fresh) {
     for (const char* kept : {kCXUIDProperty, kCXCreationDateProperty, kCXModificationDateProperty}) fresh.remove(kept);
     PendingRecord& p = pending(uid);
     work.replace(p, fresh);
-    // What was changed first was made against that row, and this replacement is made of it.
+    // The first change was made against that row, and this replacement is made of it.
     if (const auto& row = storedRow(uid); row && !p.isInsertion() && !p.knownRow) p.knownRow = row->properties;
     p.location = locationOf(is, fresh);
 }
