@@ -218,18 +218,18 @@ bool CXDVaultraConduit::makeCompositeGroupChange(CXDChangeRecord& record, int& c
         return _inDoubt.contains(uid) || (!isList && _newOnStore.waitsForList(uid));
     };
     const UniqueId here = groupInDatabase(*record.user(), *record.group());
-    std::vector<UniqueId> ofList;
-    if (isList) {
-        ofList = namedIn(*record.user(), payload, kMemberRemoves, kSubgroupRemoves);
-        ofList.insert(ofList.end(), named.begin(), named.end());
-        _newOnStore.listWaits(ofList);
+    if (!waits(here) && std::none_of(named.begin(), named.end(), waits)) {
+        if (isList) _newOnStore.willName(*record.user(), named, _world.clock.now());
+        if (writeComposite(record, payload, code)) {
+            if (_newRecords.contains(here)) _newOnStore.wasPut(*record.user(), here, _world.clock.now());
+            return true;
+        }
     }
-    if (waits(here) || std::any_of(named.begin(), named.end(), waits)) return false;
-    if (isList) _newOnStore.willName(*record.user(), named, _world.clock.now());
-    if (!writeComposite(record, payload, code)) return false;
-    _newOnStore.listWasWritten(ofList);
-    if (_newRecords.contains(here)) _newOnStore.wasPut(*record.user(), here, _world.clock.now());
-    return true;
+    if (isList) {
+        _newOnStore.listWaits(named);
+        _newOnStore.listWaits(namedIn(*record.user(), payload, kMemberRemoves, kSubgroupRemoves));
+    }
+    return false;
 }
 
 bool CXDVaultraConduit::writeComposite(CXDChangeRecord& record, const Dictionary& payload, int& code) {

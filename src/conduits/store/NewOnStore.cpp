@@ -15,11 +15,6 @@ void NewOnStore::listWaits(const std::vector<UniqueId>& records) {
     _waiting.insert(records.begin(), records.end());
 }
 
-void NewOnStore::listWasWritten(const std::vector<UniqueId>& records) {
-    const std::lock_guard guard(_lock);
-    for (const UniqueId& record : records) _waiting.erase(record);
-}
-
 bool NewOnStore::waitsForList(const UniqueId& record) {
     const std::lock_guard guard(_lock);
     return _waiting.contains(record);

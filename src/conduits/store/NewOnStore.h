@@ -23,10 +23,10 @@ public:
     void wasPut(const UserName& tree, const UniqueId& record, Date now);
     // The list of everybody is about to name them. Throws CXException where the note cannot be stored.
     void willName(const UserName& tree, const std::vector<UniqueId>& records, Date now);
-    // The list is to name them, or to name them no longer. Until it is written, new groups among them have to wait,
-    // groups that name one of them, and deletions: whoever reads half a record would list it, or take it for lost.
+    // The list could not be written that was to name them, or to name them no longer. New groups among them have to
+    // wait, groups that name one of them, and deletions: whoever reads half a record would list it, or take it for
+    // lost.
     void listWaits(const std::vector<UniqueId>& records);
-    void listWasWritten(const std::vector<UniqueId>& records);
     bool waitsForList(const UniqueId& record); // in this pass
 
 private:
