@@ -19,7 +19,7 @@
 namespace rolvane::cardbook {
 namespace {
 
-constexpr int kRounds = 100; // against other programs, each of which has saved the same card in the same moment
+constexpr int kRounds = 100; // against other programs that save the same card in the same moment
 
 Refused changedMeanwhile() {
     return {412, "The card has changed meanwhile."};

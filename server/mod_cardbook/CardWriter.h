@@ -11,7 +11,7 @@ namespace rolvane::cardbook {
 // The conditions of a request on the card that it changes (RFC 9110 section 13.1). All of it was judged once, before
 // the body.
 struct Conditions {
-    bool namesTag = false; // If-Match with tags, one of which the card had: the client has had that version
+    bool namesTag = false; // If-Match names the tag that the card had: the client has had that version
     bool exists = false;   // If-Match: *
     bool isAbsent = false; // If-None-Match: *
     bool hasDate = false;  // If-Unmodified-Since; a second is too coarse to name a version

@@ -17,7 +17,7 @@ struct ClientCard {
 };
 
 // Of the lines and values of a card. Those of a client have bounds that no program comes near. A card that is made here
-// of what the database holds has none.
+// from the database has none.
 enum class Bounds { none, ofClients };
 
 // Throws Refused: valid-address-data for a text that is no vCard, holds several, has no name, or more than the bounds

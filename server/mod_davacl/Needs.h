@@ -27,8 +27,8 @@ std::vector<Need> needsOfDestination(std::string_view method, Standing standing)
 unsigned neededOfMembers(std::string_view method, bool deep);
 // The same where such a place is the Destination of COPY or MOVE.
 unsigned neededOfMembersReplaced();
-// What a request for a place in a tree needs of the places within it that have lists of their own: mod_dav does not ask
-// for each member. What is left out of a listing, or goes with its collection, needs nothing.
+// The rights that a request for a place in a tree needs to the places within it that have lists of their own: mod_dav
+// does not ask for each member. What is left out of a listing, or goes with its collection, needs nothing.
 unsigned neededWithin(std::string_view method, bool deep);
 
 // Whether a method changes what is stored.
