@@ -1,5 +1,6 @@
 #include "server/mod_cardbook/CardWriter.h"
 
+#include "contacts/database/History.h"
 #include "contacts/database/Journal.h"
 #include "contacts/vcard/VCardFields.h"
 #include "contacts/vcard/VCardReader.h"
@@ -7,10 +8,10 @@
 #include "foundation/PropertyList.h"
 #include "server/mod_cardbook/CardMerge.h"
 #include "server/mod_cardbook/CardText.h"
-#include "server/mod_cardbook/Devices.h"
 #include "server/mod_cardbook/Refused.h"
 #include "server/mod_cardbook/XmlText.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <fcntl.h>
 #include <sys/file.h>
@@ -112,10 +113,17 @@ Date CardWriter::dateOfSave(const CXExpected& before, int64_t since) {
 // Finding ----------------------------------------------------------------------------------------------------------
 
 // References to a UUID may be spelt in the other letter case than the record.
-CXRecordRef CardWriter::recordOf(const std::string& uid, std::string_view table) {
+std::vector<UniqueId> CardWriter::spellingsOf(const std::string& uid, std::string_view table) {
     const std::string uuid = vcardUUIDForUID(uid);
+    std::vector<UniqueId> all;
     for (const std::string& spelling : {uuid, vcardUpper(uuid), vcardLower(uuid)})
-        if (auto record = _rolvane.recordForUniqueId(UniqueId(spelling + ":" + std::string(table)))) return record;
+        all.emplace_back(spelling + ":" + std::string(table));
+    return all;
+}
+
+CXRecordRef CardWriter::recordOf(const std::string& uid, std::string_view table) {
+    for (const UniqueId& spelling : spellingsOf(uid, table))
+        if (auto record = _rolvane.recordForUniqueId(spelling)) return record;
     return nullptr;
 }
 
@@ -249,14 +257,15 @@ std::optional<Written> CardWriter::putGroup(const ClientCard& card, const std::o
     VCardEntity before;
     Dictionary stored;
     std::optional<Dictionary> had;
-    bool mayRemove = _c.conditions.namesTag;
+    Devices::Had listed; // the lists that the client had
     if (group) {
         stored = group->dictionaryRepresentation();
         before = groupEntity(_rolvane, *group);
         expected.push_back({group->uniqueId(), group->valueForProperty(kCXModificationDateProperty).date()});
         if (now && expected.back().modified != now->modified) return std::nullopt; // as of a person
         had = hadBy(now, stored);
-        mayRemove = mayRemove || Devices(_memory).had(_c.device, _c.book.id, *now).isPresent;
+        if (now) listed = Devices(_memory).had(_c.device, _c.book.id, *now);
+        listed.isPresent |= _c.conditions.namesTag;
     } else {
         group =
             CXGroup::initWithUniqueId(UniqueId(vcardUUIDForUID(card.entity.uid) + ":" + std::string(kCXGroupTable)));
@@ -269,7 +278,7 @@ std::optional<Written> CardWriter::putGroup(const ClientCard& card, const std::o
         const bool isTheClients = !had || (*had)[name] != value; // else it is as the client found it
         if (isTheClients && group->valueForProperty(name) != value) group->setValue(value, name);
     }
-    setMembers(group, card, before, vcardKeptLines(stored, kVCardMissingMemberLine), mayRemove);
+    setMembers(group, card, before, vcardKeptLines(stored, kVCardMissingMemberLine), listed);
     const UniqueId uid = group->uniqueId();
     const VCardEntity after = groupEntity(_rolvane, *group);
     const bool isWhole = card.isWhole && after.members == card.entity.members &&
@@ -289,19 +298,34 @@ std::optional<Written> CardWriter::putGroup(const ClientCard& card, const std::o
     return Written{isWhole ? Library::tagOf(uid, date) : "", !now};
 }
 
-// Members who have no card here are kept by their UIDs, as the import does. A client that never wrote a member does not
-// know of members.
+// Each member for itself: a change of the client's against the lists that it had is made, and one that somebody else
+// has made since stands. Members who have no card here are kept by their UIDs, as the import does. A client that never
+// wrote a member does not know of members.
 void CardWriter::setMembers(const CXGroupRef& group, const ClientCard& card, const VCardEntity& before,
-                            std::vector<VCardLine> missing, bool mayRemove) {
-    std::set<std::string> said;
+                            std::vector<VCardLine> missing, const Devices::Had& had) {
+    CXHistory history(_rolvane);
+    const auto wasListed = [&](const UniqueId& record, bool isNow) -> std::optional<bool> {
+        if (had.isPresent) return isNow;
+        return had.then ? history.wasListed(*had.then, group->uniqueId(), record, isNow) : std::nullopt;
+    };
+    std::set<std::string> now, said;
+    for (const auto* list : {&before.members, &before.subgroups})
+        for (const std::string& uid : *list) now.insert(vcardMemberKey(uid));
+    const auto hasLeft = [&](const std::string& uid, std::string_view table) {
+        if (had.isPresent || !had.then || now.contains(vcardMemberKey(uid))) return false;
+        const auto spellings = spellingsOf(uid, table);
+        return std::any_of(spellings.begin(), spellings.end(),
+                           [&](const UniqueId& record) { return wasListed(record, false) == true; });
+    };
     const bool saysMembers = !card.entity.members.empty() || !card.entity.subgroups.empty();
-    const bool removes = mayRemove && (saysMembers || Devices(_memory).knows(_c.device, "line:MEMBER"));
-    if (removes) missing.clear();
+    const bool knowsMembers = saysMembers || Devices(_memory).knows(_c.device, "line:MEMBER");
+    if (had.isPresent && knowsMembers) missing.clear();
     std::set<std::string> known; // the values of `missing`
     for (const VCardLine& line : missing) known.insert(line.value);
     for (const auto* list : {&card.entity.members, &card.entity.subgroups})
         for (const std::string& uid : *list) {
             said.insert(vcardMemberKey(uid));
+            if (hasLeft(uid, kCXPersonTable) || hasLeft(uid, kCXGroupTable)) continue;
             if (auto person = std::dynamic_pointer_cast<CXPerson>(recordOf(uid, kCXPersonTable))) {
                 group->addMember(person);
             } else if (auto subgroup = std::dynamic_pointer_cast<CXGroup>(recordOf(uid, kCXGroupTable))) {
@@ -314,14 +338,16 @@ void CardWriter::setMembers(const CXGroupRef& group, const ClientCard& card, con
             }
         }
     setMissingMembers(group, missing);
-    if (!removes) return;
+    if (!knowsMembers) return;
     for (const std::string& uid : before.members)
         if (!said.contains(vcardMemberKey(uid)))
-            if (auto person = std::dynamic_pointer_cast<CXPerson>(recordOf(uid, kCXPersonTable)))
+            if (auto person = std::dynamic_pointer_cast<CXPerson>(recordOf(uid, kCXPersonTable));
+                person && wasListed(person->uniqueId(), true) == true)
                 group->removeMember(person);
     for (const std::string& uid : before.subgroups)
         if (!said.contains(vcardMemberKey(uid)))
-            if (auto subgroup = std::dynamic_pointer_cast<CXGroup>(recordOf(uid, kCXGroupTable)))
+            if (auto subgroup = std::dynamic_pointer_cast<CXGroup>(recordOf(uid, kCXGroupTable));
+                subgroup && wasListed(subgroup->uniqueId(), true) == true)
                 group->removeSubgroup(subgroup);
 }
 

@@ -1,6 +1,7 @@
 #pragma once
 
 #include "server/mod_cardbook/ClientCard.h"
+#include "server/mod_cardbook/Devices.h"
 #include "server/mod_cardbook/Library.h"
 
 #include <optional>
@@ -56,6 +57,7 @@ private:
     class Turn; // of a writer
     std::optional<Member> settle();
     void requireWritable(const Book& book) const;
+    static std::vector<UniqueId> spellingsOf(const std::string& uid, std::string_view table);
     CXRecordRef recordOf(const std::string& uid, std::string_view table);
     [[noreturn]] void conflict(const Member& other, const std::string& book = {}); // in that book, else in this one
     void requireFreeUID(const ClientCard& card, const std::optional<Member>& now);
@@ -67,7 +69,7 @@ private:
     std::optional<Dictionary> hadBy(const std::optional<Member>& now, const Dictionary& properties);
     void apply(const CXPersonRef& person, const Dictionary& before, const Dictionary& after);
     void setMembers(const CXGroupRef& group, const ClientCard& card, const VCardEntity& before,
-                    std::vector<VCardLine> missing, bool mayRemove);
+                    std::vector<VCardLine> missing, const Devices::Had& had);
     static void setMissingMembers(const CXGroupRef& group, const std::vector<VCardLine>& missing);
     void joinGroupsThatWaitFor(const CXRecordRef& record, const std::string& uid);
     CXGroupRef groupOf(const Book& book);

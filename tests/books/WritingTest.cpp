@@ -407,6 +407,42 @@ TEST(Groups, AreJoinedByMembersWhoseCardsComeLater) {
     EXPECT_THAT(served, HasSubstr("MEMBER:urn:uuid:" + kUUID + "\r\n"));
 }
 
+// Of each member, what one of the two has changed since the device read the card stands.
+TEST(Groups, AreMergedMemberByMemberWithAnOlderCardThatComesWithoutATag) {
+    BooksWorld world;
+    const auto ann = world.addPerson("Ann", "Lee"), bob = world.addPerson("Bob", "May"),
+               cleo = world.addPerson("Cleo", "Fox"), dora = world.addPerson("Dora", "Ray"),
+               eve = world.addPerson("Eve", "Sun"), finn = world.addPerson("Finn", "Roe");
+    const auto group = world.addGroup("Friends", {ann, bob, cleo, finn}), inner = world.addGroup("Inner", {});
+    group->addSubgroup(inner);
+    world.rolvane().save();
+    const std::string path = at(BooksWorld::uuidOf(group) + ".vcf");
+    const auto card = [&](const std::string& name, const std::vector<CXRecordRef>& members) {
+        std::string text = "BEGIN:VCARD\r\nVERSION:4.0\r\nUID:urn:uuid:" + BooksWorld::uuidOf(group) +
+                           "\r\nKIND:group\r\nFN:" + name + "\r\n";
+        for (const auto& member : members) text += "MEMBER:urn:uuid:" + BooksWorld::uuidOf(member) + "\r\n";
+        return text + "END:VCARD\r\n";
+    };
+    world.multiget(kContacts, {path});
+    group->removeMember(bob);
+    group->removeSubgroup(inner);
+    group->addMember(dora);
+    world.rolvane().removeRecord(finn);
+    world.rolvane().save();
+    EXPECT_EQ(world.put(path, card("Pals", {ann, bob, eve, finn, inner})).status, 204) << world.log();
+    EXPECT_EQ(group->name(), "Pals");
+    EXPECT_THAT(group->memberUniqueIds(),
+                testing::UnorderedElementsAre(ann->uniqueId(), dora->uniqueId(), eve->uniqueId()));
+    EXPECT_TRUE(group->subgroups().empty());
+    EXPECT_THAT(world.ask("GET", path).body, Not(HasSubstr(BooksWorld::uuidOf(finn))))
+        << "nor is a name kept for later";
+    // A device that has read the group since may put them in again, and one that never read it takes nobody out.
+    EXPECT_EQ(world.put(path, card("Pals", {ann, bob})).status, 204);
+    EXPECT_THAT(group->memberUniqueIds(), testing::UnorderedElementsAre(ann->uniqueId(), bob->uniqueId()));
+    EXPECT_EQ(world.put(path, card("Pals", {cleo}), {}, "phone").status, 204);
+    EXPECT_EQ(group->memberCount(), 3u);
+}
+
 TEST(GroupBooks, LetPeopleJoinAndLeaveWhoStayInContacts) {
     BooksWorld world;
     const auto ann = world.addPerson("Ann", "Lee");

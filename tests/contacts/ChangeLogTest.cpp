@@ -216,6 +216,29 @@ TEST_F(History, IsKeptForThirtyDaysAndWithinItsBound) {
     EXPECT_EQ(history.latest(10).size(), 2U);
 }
 
+TEST_F(History, TellsWhoWasInAGroupAtAMoment) {
+    const auto wasIn = [&](double moment, const CXPersonRef& who, bool isNow) {
+        return history.wasListed(Date(1700000000 + moment), family->uniqueId(), who->uniqueId(), isNow);
+    };
+    const auto change = [&](double seconds, auto edit) {
+        d.clock.advance(seconds);
+        edit();
+        d->save();
+    };
+    change(10, [&] { family->removeMember(ada); });
+    change(10, [&] { family->addMember(cleo); });
+    change(10, [&] { family->addMember(ada); });
+    EXPECT_EQ(wasIn(5, ada, true), true);
+    EXPECT_EQ(wasIn(10, ada, true), false);
+    EXPECT_EQ(wasIn(30, ada, true), true);
+    EXPECT_EQ(wasIn(15, cleo, true), false);
+    EXPECT_EQ(wasIn(20, cleo, true), true);
+    EXPECT_EQ(wasIn(-1, ada, true), std::nullopt) << "before the log";
+    const UniqueId cleos = cleo->uniqueId();
+    change(10, [&] { d->removeRecord(cleo); });
+    EXPECT_EQ(history.wasListed(Date(1700000035), family->uniqueId(), cleos, false), true) << "by a deletion, too";
+}
+
 TEST_F(History, HoldsNoMoreThanItsBoundAndForgetsWholeChanges) {
     Sqlite database(d.path, 1000);
     constexpr int64_t kBound = 10000;

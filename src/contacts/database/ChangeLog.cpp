@@ -84,6 +84,18 @@ std::vector<CXChangeDetail> ChangeLog::deleted() {
     return selected("WHERE kind=3 ORDER BY id DESC", 0, {});
 }
 
+bool ChangeLog::reachesBackTo(Date moment) {
+    auto s = _database.statement("SELECT date FROM changes ORDER BY id LIMIT 1");
+    return s.step() && s.real(0) <= moment.secondsSince1970();
+}
+
+std::optional<CXDetailKind> ChangeLog::firstMoveSince(Date moment, const UniqueId& group, const UniqueId& member) {
+    auto s = _database.statement("SELECT d.kind FROM details d JOIN changes c ON c.id=d.change WHERE d.uid=?1 AND "
+                                 "d.other=?2 AND d.kind IN (4,5) AND c.date>?3 ORDER BY d.id LIMIT 1");
+    s.bind(1, member.str()).bind(2, group.str()).bind(3, moment.secondsSince1970());
+    return s.step() ? std::optional(static_cast<CXDetailKind>(s.integer(0))) : std::nullopt;
+}
+
 void ChangeLog::begin(const std::string& program, Date date) {
     _program = program;
     _date = date;

@@ -54,6 +54,14 @@ std::vector<CXChangeDetail> CXHistory::details(int64_t change, const std::option
     return _rolvane.impl().changeLog.details(change, of);
 }
 
+std::optional<bool> CXHistory::wasListed(Date moment, const UniqueId& group, const UniqueId& member, bool isNow) {
+    std::lock_guard lock(_rolvane.impl().mutex);
+    ChangeLog& log = _rolvane.impl().changeLog;
+    if (!log.reachesBackTo(moment)) return std::nullopt;
+    const auto move = log.firstMoveSince(moment, group, member);
+    return move ? *move == CXDetailKind::left : isNow;
+}
+
 Dictionary CXHistory::after(const CXChangeDetail& detail) {
     std::lock_guard lock(_rolvane.impl().mutex);
     if (detail.kind == CXDetailKind::deleted) return {};
