@@ -8,7 +8,8 @@
 namespace rolvane::cardbook {
 namespace {
 
-constexpr int kFormat = 3; // 1 had no table joined; in 2, looks were noted of devices that had been told of tags alone
+// 1 had no table joined; in 2, looks were noted of devices that had been told of tags alone; 3 had no table waiting
+constexpr int kFormat = 4;
 constexpr const char* kTables = R"(
 CREATE TABLE meta(key TEXT PRIMARY KEY, value) WITHOUT ROWID;
 CREATE TABLE books(id INTEGER PRIMARY KEY, book TEXT NOT NULL UNIQUE, seq INTEGER NOT NULL, begun INTEGER NOT NULL,
@@ -37,6 +38,10 @@ constexpr const char* kJoinedTable = R"(
 CREATE TABLE joined(key TEXT NOT NULL, uid TEXT NOT NULL, PRIMARY KEY(key, uid)) WITHOUT ROWID;
 CREATE INDEX joined_uid ON joined(uid);
 )";
+constexpr const char* kWaitingTable = R"(
+CREATE TABLE waiting(key TEXT NOT NULL, uid TEXT NOT NULL, PRIMARY KEY(key, uid)) WITHOUT ROWID;
+CREATE INDEX waiting_uid ON waiting(uid);
+)";
 
 Member memberAt(const Sqlite::Statement& s) {
     return {UniqueId(s.textView(0)), s.text(1), Date(s.real(2)), s.integer(3), s.integer(4) != 0};
@@ -54,10 +59,11 @@ BookMemory::BookMemory(const std::string& path, int busyTimeoutMilliseconds, int
         throw CXException(kCXDatabaseException, path + " was written by a newer version of this program.");
     if (format == kFormat) return; // another process was faster
     if (format < 2) _sqlite.execute(kJoinedTable);
+    _sqlite.execute(kWaitingTable);
     _sqlite.execute("PRAGMA user_version=" + std::to_string(kFormat));
     if (format > 0) {
-        if (format == 1) _sqlite.execute("DELETE FROM meta WHERE key='position'"); // everybody is looked at once more
-        _sqlite.execute("DELETE FROM looks");
+        _sqlite.execute("DELETE FROM meta WHERE key='position'"); // everybody is looked at once more
+        if (format < 3) _sqlite.execute("DELETE FROM looks");
         transaction.commit();
         return;
     }
@@ -307,6 +313,7 @@ void BookMemory::forgetOldDepartures() {
 
 void BookMemory::beginComparison() {
     _comparison = nextSequence();
+    _sqlite.execute("DELETE FROM waiting");
 }
 
 void BookMemory::endComparison() {
@@ -330,6 +337,28 @@ void BookMemory::setJoined(const UniqueId& uid, const std::vector<std::string>& 
 std::optional<UniqueId> BookMemory::joinedAs(const std::string& key) {
     auto s = _sqlite.statement("SELECT uid FROM joined WHERE key=?");
     return s.bind(1, key).step() ? std::optional(UniqueId(s.textView(0))) : std::nullopt;
+}
+
+void BookMemory::setWaiting(const UniqueId& group, const std::set<std::string>& keys) {
+    std::set<std::string> fresh = keys, former;
+    {
+        auto s = _sqlite.statement("SELECT key FROM waiting WHERE uid=?");
+        s.bind(1, group.str());
+        while (s.step())
+            if (fresh.erase(s.text(0)) == 0) former.insert(s.text(0));
+    }
+    for (const std::string& key : former)
+        _sqlite.statement("DELETE FROM waiting WHERE key=?1 AND uid=?2").bind(1, key).bind(2, group.str()).run();
+    for (const std::string& key : fresh)
+        _sqlite.statement("INSERT INTO waiting VALUES(?,?)").bind(1, key).bind(2, group.str()).run();
+}
+
+std::vector<UniqueId> BookMemory::waitingFor(const std::string& key) {
+    auto s = _sqlite.statement("SELECT uid FROM waiting WHERE key=?");
+    s.bind(1, key);
+    std::vector<UniqueId> all;
+    while (s.step()) all.emplace_back(s.textView(0));
+    return all;
 }
 
 // Texts ------------------------------------------------------------------------------------------------------------

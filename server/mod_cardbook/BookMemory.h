@@ -5,6 +5,7 @@
 #include "foundation/StrongString.h"
 
 #include <optional>
+#include <set>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -80,13 +81,18 @@ public:
     void wish(std::string_view book, const UniqueId& uid, std::string_view name);
     void rename(std::string_view book, const Member& member, std::string_view name); // to one that is free
     void forgetOldDepartures();
-    // A comparison of everything: between the two, every card that is there is noted; the others are then gone.
+    // A comparison of everything: between the two, every card that is there is noted, and every group that waits; the
+    // others are then gone.
     void beginComparison();
     void endComparison();
 
     // The UIDs, by vcardMemberKey, of cards whose people were joined with this one.
     void setJoined(const UniqueId& uid, const std::vector<std::string>& keys);
     std::optional<UniqueId> joinedAs(const std::string& key);
+
+    // The members that the group's card names and that are nowhere, by vcardMemberKey.
+    void setWaiting(const UniqueId& group, const std::set<std::string>& keys);
+    std::vector<UniqueId> waitingFor(const std::string& key); // groups; perhaps one that has gone
 
     // Texts: of a record with that digest of its properties.
     std::optional<WrittenCard> written(const UniqueId& uid, const Bytes& digest);

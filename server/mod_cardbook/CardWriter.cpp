@@ -360,9 +360,9 @@ void CardWriter::setMissingMembers(const CXGroupRef& group, const std::vector<VC
 
 // Groups whose cards came before this one, and name it, list it from now on.
 void CardWriter::joinGroupsThatWaitFor(const CXRecordRef& record, const std::string& uid) {
-    for (const CXListing& line : _rolvane.listGroups(RemoteLocation(""))) {
-        const auto group = std::dynamic_pointer_cast<CXGroup>(_rolvane.recordForUniqueId(line.uniqueId));
-        if (!group || group->isAllGroup() || group->uniqueId() == record->uniqueId()) continue;
+    for (const UniqueId& waiting : _memory.waitingFor(vcardMemberKey(uid))) {
+        const auto group = std::dynamic_pointer_cast<CXGroup>(_rolvane.recordForUniqueId(waiting));
+        if (!group || waiting == record->uniqueId()) continue;
         auto missing = vcardKeptLines(group->dictionaryRepresentation(), kVCardMissingMemberLine);
         const auto isIt = [&](const VCardLine& each) {
             return vcardMemberKey(vcardUnescape(each.value)) == vcardMemberKey(uid);

@@ -110,6 +110,14 @@ private:
         _memory.setJoined(row.uniqueId, keys);
     }
 
+    void noteWaiting(const UniqueId& uid, const CXGroup* group) {
+        std::set<std::string> keys;
+        if (group && group->valueForProperty(kCXVCardExtraProperty))
+            for (const VCardLine& line : vcardKeptLines(group->dictionaryRepresentation(), kVCardMissingMemberLine))
+                keys.insert(vcardMemberKey(vcardUnescape(line.value)));
+        _memory.setWaiting(uid, keys);
+    }
+
     struct Whereabouts {
         Date modified;
         std::vector<std::string> books; // none: there is no such record
@@ -122,6 +130,7 @@ private:
             return row ? Whereabouts{row->modified, booksOf(*row)} : Whereabouts{};
         }
         const auto group = std::dynamic_pointer_cast<CXGroup>(_rolvane.recordForUniqueId(uid));
+        if (!cxIsSubscribed(uid)) noteWaiting(uid, group.get());
         const auto modified = group ? group->valueForProperty(kCXModificationDateProperty).date() : std::nullopt;
         if (!modified || group->isAllGroup()) return {};
         if (!group->isSubscribed()) return {*modified, {std::string(kContactsBook)}};

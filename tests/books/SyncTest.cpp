@@ -1,6 +1,7 @@
 #include "BooksWorld.h"
 
 #include "server/mod_cardbook/CatchUp.h"
+#include "server/mod_cardbook/Devices.h"
 #include "server/mod_cardbook/Library.h"
 
 #include <gmock/gmock.h>
@@ -222,24 +223,30 @@ TEST(Sync, GoesOnOnAnEarlierCopyOfTheDatabaseAndKeepsTheNames) {
     EXPECT_TRUE(library.memory().named(cardbook::kContactsBook, "mine.vcf"));
 }
 
-TEST(BookMemory, OfTheFormBeforeKeepsNamesAndTokensAndLooksAtEverybodyOnceMore) {
-    test::TempDirectory directory;
-    std::string epoch;
-    {
+TEST(BookMemory, OfAFormBeforeKeepsNamesAndTokensAndLooksAtEverybodyOnceMore) {
+    for (const int format : {1, 2, 3}) {
+        test::TempDirectory directory;
+        std::string epoch;
+        {
+            cardbook::BookMemory memory(directory / "books", 1000);
+            epoch = memory.epoch();
+            cardbook::BookMemory::Change change(memory);
+            memory.note("contacts", UniqueId("1:CXPerson"), Date(1));
+            memory.setPosition(7, {});
+            cardbook::Devices(memory).noteLook("laptop", "contacts", 1, Date(1));
+            change.commit();
+            if (format < 2) memory.sqlite().execute("DROP TABLE joined");
+            memory.sqlite().execute("DROP TABLE waiting");
+            memory.sqlite().execute("PRAGMA user_version=" + std::to_string(format));
+        }
         cardbook::BookMemory memory(directory / "books", 1000);
-        epoch = memory.epoch();
-        cardbook::BookMemory::Change change(memory);
-        memory.note("contacts", UniqueId("1:CXPerson"), Date(1));
-        memory.setPosition(7, {});
-        change.commit();
-        memory.sqlite().execute("DROP TABLE joined");
-        memory.sqlite().execute("PRAGMA user_version=1");
+        EXPECT_EQ(memory.epoch(), epoch) << format;
+        EXPECT_EQ(memory.position(), -1) << format;
+        EXPECT_TRUE(memory.named("contacts", "1.vcf")) << format;
+        EXPECT_FALSE(memory.joinedAs("x")) << format;
+        EXPECT_TRUE(memory.waitingFor("x").empty()) << format;
+        EXPECT_EQ(cardbook::Devices(memory).lookedAt("laptop", "contacts"), format < 3 ? -1 : 1);
     }
-    cardbook::BookMemory memory(directory / "books", 1000);
-    EXPECT_EQ(memory.epoch(), epoch);
-    EXPECT_EQ(memory.position(), -1);
-    EXPECT_TRUE(memory.named("contacts", "1.vcf"));
-    EXPECT_FALSE(memory.joinedAs("x"));
 }
 
 TEST(BookMemory, ForgetsTheOldestDeparturesAndTheirTokens) {
