@@ -304,18 +304,19 @@ std::optional<Written> CardWriter::putGroup(const ClientCard& card, const std::o
 void CardWriter::setMembers(const CXGroupRef& group, const ClientCard& card, const VCardEntity& before,
                             std::vector<VCardLine> missing, const Devices::Had& had) {
     CXHistory history(_rolvane);
-    const auto wasListed = [&](const UniqueId& record, bool isNow) -> std::optional<bool> {
-        if (had.isPresent) return isNow;
-        return had.then ? history.wasListed(*had.then, group->uniqueId(), record, isNow) : std::nullopt;
+    const auto then = !had.isPresent && had.then ? history.lastUntil(*had.then) : std::nullopt;
+    const auto wasListed = [&](const UniqueId& record) {
+        return had.isPresent || (then && history.wasListed(*then, group->uniqueId(), record, true));
     };
     std::set<std::string> now, said;
     for (const auto* list : {&before.members, &before.subgroups})
         for (const std::string& uid : *list) now.insert(vcardMemberKey(uid));
     const auto hasLeft = [&](const std::string& uid, std::string_view table) {
-        if (had.isPresent || !had.then || now.contains(vcardMemberKey(uid))) return false;
+        if (!then || now.contains(vcardMemberKey(uid))) return false;
         const auto spellings = spellingsOf(uid, table);
-        return std::any_of(spellings.begin(), spellings.end(),
-                           [&](const UniqueId& record) { return wasListed(record, false) == true; });
+        return std::any_of(spellings.begin(), spellings.end(), [&](const UniqueId& record) {
+            return history.wasListed(*then, group->uniqueId(), record, false);
+        });
     };
     const bool saysMembers = !card.entity.members.empty() || !card.entity.subgroups.empty();
     const bool knowsMembers = saysMembers || Devices(_memory).knows(_c.device, "line:MEMBER");
@@ -342,12 +343,12 @@ void CardWriter::setMembers(const CXGroupRef& group, const ClientCard& card, con
     for (const std::string& uid : before.members)
         if (!said.contains(vcardMemberKey(uid)))
             if (auto person = std::dynamic_pointer_cast<CXPerson>(recordOf(uid, kCXPersonTable));
-                person && wasListed(person->uniqueId(), true) == true)
+                person && wasListed(person->uniqueId()))
                 group->removeMember(person);
     for (const std::string& uid : before.subgroups)
         if (!said.contains(vcardMemberKey(uid)))
             if (auto subgroup = std::dynamic_pointer_cast<CXGroup>(recordOf(uid, kCXGroupTable));
-                subgroup && wasListed(subgroup->uniqueId(), true) == true)
+                subgroup && wasListed(subgroup->uniqueId()))
                 group->removeSubgroup(subgroup);
 }
 

@@ -191,5 +191,84 @@ TEST_F(Races, AGroupsCardIsMergedWithASaveOnEitherSideOfItsLookAtTheRecord) {
     EXPECT_EQ(putBehindTheJournal(request(tag()), groupCard("ORG:Else\r\n"), friends, kCXNoteProperty, "more"), 412);
 }
 
+// A clock that was set back, and forth again, between the versions of a card.
+class ClockSteps : public Races {
+protected:
+    ClockSteps() : _program(stepping(path, clock)) {}
+
+    void save(double seconds, const std::function<void(CXRolvane&)>& edit) {
+        clock.set(Date(seconds));
+        edit(_program);
+        _program.save();
+    }
+    static CXRolvane::Options stepping(const std::string& path, const Clock& clock) {
+        CXRolvane::Options chosen = otherProgram(path);
+        chosen.clock = &clock;
+        return chosen;
+    }
+
+    ManualClock clock{Date(1000)};
+
+private:
+    CXRolvane _program;
+};
+
+TEST_F(ClockSteps, GiveNoOlderCardPowerOverANewerEdit) {
+    const auto note = [&](const char* text) {
+        return [this, text](CXRolvane& program) { program.recordForUniqueId(ann)->setValue(text, kCXNoteProperty); };
+    };
+    save(1000, [&](CXRolvane& program) {
+        const auto person = CXPerson::initWithUniqueId(ann);
+        person->resetWithDictionary(Dictionary{{kCXFirstNameProperty, "Ann"}, {kCXNoteProperty, "first"}}, true, false);
+        program.addRecord(person);
+    });
+    library.catchUp();
+    {
+        BookMemory::Change change(library.memory());
+        library.memory().rename(kContactsBook, *library.memory().of(kContactsBook, ann), name);
+        change.commit();
+    }
+    read();
+    save(500, note("second"));
+    save(600, note("third"));
+    save(1100, [&](CXRolvane& program) { program.recordForUniqueId(ann)->setValue("Boss", kCXJobTitleProperty); });
+    EXPECT_EQ(put(request(), card("NOTE:first\r\nORG:Example\r\n")), 204);
+    EXPECT_THAT(served(), HasSubstr("third"));
+    EXPECT_THAT(served(), HasSubstr("ORG:Example"));
+}
+
+TEST_F(ClockSteps, TakeNobodyOutOfAGroupWhoHasJoinedSince) {
+    const std::string cleos = "6F0C1B2A-8B7E-4B53-9B7E-0B8C3D1E2F3C";
+    const UniqueId bob("6F0C1B2A-8B7E-4B53-9B7E-0B8C3D1E2F3B:CXPerson"), cleo(cleos + ":CXPerson");
+    const auto group = [&](CXRolvane& program) {
+        return std::dynamic_pointer_cast<CXGroup>(program.recordForUniqueId(friends));
+    };
+    const auto person = [&](CXRolvane& program, const UniqueId& uid) {
+        return std::dynamic_pointer_cast<CXPerson>(program.recordForUniqueId(uid));
+    };
+    save(1000, [&](CXRolvane& program) {
+        for (const UniqueId& uid : {cleo, bob}) {
+            const auto made = CXPerson::initWithUniqueId(uid);
+            made->setValue("Somebody", kCXFirstNameProperty);
+            program.addRecord(made);
+        }
+        const auto made = CXGroup::initWithUniqueId(friends);
+        made->setValue("Friends", kCXGroupNameProperty);
+        program.addRecord(made);
+        made->addMember(person(program, cleo));
+    });
+    library.catchUp();
+    {
+        BookMemory::Change change(library.memory());
+        library.memory().rename(kContactsBook, *library.memory().of(kContactsBook, friends), name);
+        change.commit();
+    }
+    read();
+    save(500, [&](CXRolvane& program) { group(program)->addMember(person(program, bob)); });
+    save(1100, [&](CXRolvane& program) { group(program)->setValue("so", kCXNoteProperty); });
+    EXPECT_EQ(put(request(), groupCard("MEMBER:urn:uuid:" + cleos + "\r\n")), 204);
+    EXPECT_EQ(group(library.rolvane())->memberCount(), 2u);
+}
+
 } // namespace
 } // namespace rolvane

@@ -217,8 +217,9 @@ TEST_F(History, IsKeptForThirtyDaysAndWithinItsBound) {
 }
 
 TEST_F(History, TellsWhoWasInAGroupAtAMoment) {
-    const auto wasIn = [&](double moment, const CXPersonRef& who, bool isNow) {
-        return history.wasListed(Date(1700000000 + moment), family->uniqueId(), who->uniqueId(), isNow);
+    const auto wasIn = [&](double moment, const UniqueId& who, bool isNow) -> std::optional<bool> {
+        const auto until = history.lastUntil(Date(1700000000 + moment));
+        return until ? std::optional(history.wasListed(*until, family->uniqueId(), who, isNow)) : std::nullopt;
     };
     const auto change = [&](double seconds, auto edit) {
         d.clock.advance(seconds);
@@ -228,15 +229,20 @@ TEST_F(History, TellsWhoWasInAGroupAtAMoment) {
     change(10, [&] { family->removeMember(ada); });
     change(10, [&] { family->addMember(cleo); });
     change(10, [&] { family->addMember(ada); });
-    EXPECT_EQ(wasIn(5, ada, true), true);
-    EXPECT_EQ(wasIn(10, ada, true), false);
-    EXPECT_EQ(wasIn(30, ada, true), true);
-    EXPECT_EQ(wasIn(15, cleo, true), false);
-    EXPECT_EQ(wasIn(20, cleo, true), true);
-    EXPECT_EQ(wasIn(-1, ada, true), std::nullopt) << "before the log";
-    const UniqueId cleos = cleo->uniqueId();
+    const UniqueId adas = ada->uniqueId(), cleos = cleo->uniqueId();
+    EXPECT_EQ(wasIn(5, adas, true), true);
+    EXPECT_EQ(wasIn(10, adas, true), false);
+    EXPECT_EQ(wasIn(30, adas, true), true);
+    EXPECT_EQ(wasIn(15, cleos, true), false);
+    EXPECT_EQ(wasIn(20, cleos, true), true);
+    EXPECT_EQ(wasIn(-1, adas, true), std::nullopt) << "before the log";
     change(10, [&] { d->removeRecord(cleo); });
-    EXPECT_EQ(history.wasListed(Date(1700000035), family->uniqueId(), cleos, false), true) << "by a deletion, too";
+    EXPECT_EQ(wasIn(35, cleos, false), true) << "by a deletion, too";
+    change(-5, [&] { family->removeMember(ada); });
+    EXPECT_EQ(wasIn(38, adas, false), std::nullopt) << "before or behind the set-back, nobody knows";
+    EXPECT_EQ(wasIn(40, adas, false), std::nullopt);
+    change(20, [&] { family->addMember(ada); });
+    EXPECT_EQ(wasIn(50, adas, true), false);
 }
 
 TEST_F(History, HoldsNoMoreThanItsBoundAndForgetsWholeChanges) {

@@ -84,15 +84,20 @@ std::vector<CXChangeDetail> ChangeLog::deleted() {
     return selected("WHERE kind=3 ORDER BY id DESC", 0, {});
 }
 
-bool ChangeLog::reachesBackTo(Date moment) {
-    auto s = _database.statement("SELECT date FROM changes ORDER BY id LIMIT 1");
-    return s.step() && s.real(0) <= moment.secondsSince1970();
+std::optional<int64_t> ChangeLog::lastUntil(Date moment) {
+    auto setBack =
+        _database.statement("SELECT 1 FROM (SELECT date, lag(date) OVER (ORDER BY id) AS former FROM changes) "
+                            "WHERE former>date AND former>=?1 LIMIT 1");
+    if (setBack.bind(1, moment.secondsSince1970()).step()) return std::nullopt;
+    auto s = _database.statement("SELECT max(id) FROM changes WHERE date<=?1");
+    s.bind(1, moment.secondsSince1970()).step();
+    return s.isNull(0) ? std::nullopt : std::optional(s.integer(0));
 }
 
-std::optional<CXDetailKind> ChangeLog::firstMoveSince(Date moment, const UniqueId& group, const UniqueId& member) {
-    auto s = _database.statement("SELECT d.kind FROM details d JOIN changes c ON c.id=d.change WHERE d.uid=?1 AND "
-                                 "d.other=?2 AND d.kind IN (4,5) AND c.date>?3 ORDER BY d.id LIMIT 1");
-    s.bind(1, member.str()).bind(2, group.str()).bind(3, moment.secondsSince1970());
+std::optional<CXDetailKind> ChangeLog::firstMoveBehind(int64_t change, const UniqueId& group, const UniqueId& member) {
+    auto s = _database.statement("SELECT kind FROM details WHERE uid=?1 AND other=?2 AND kind IN (4,5) AND change>?3 "
+                                 "ORDER BY id LIMIT 1");
+    s.bind(1, member.str()).bind(2, group.str()).bind(3, change);
     return s.step() ? std::optional(static_cast<CXDetailKind>(s.integer(0))) : std::nullopt;
 }
 

@@ -76,10 +76,11 @@ CREATE INDEX IF NOT EXISTS details_uid ON details(uid);
     bool isTouchedAfter(const CXChangeDetail& detail);
     // All that were deleted, with what they were, newest first.
     std::vector<CXChangeDetail> deleted();
-    // Is every change since that moment in the log?
-    bool reachesBackTo(Date moment);
-    // The first change behind that moment of the member's place in the group: joined or left. Nothing: there is none.
-    std::optional<CXDetailKind> firstMoveSince(Date moment, const UniqueId& group, const UniqueId& member);
+    // The number of the last change until that moment. Nothing where the log does not reach back so far, or the clock
+    // was set back from there.
+    std::optional<int64_t> lastUntil(Date moment);
+    // The first move of the member behind that change, into the group or out of it. Nothing: there is none.
+    std::optional<CXDetailKind> firstMoveBehind(int64_t change, const UniqueId& group, const UniqueId& member);
 
     // Within a transaction: one save notes what it does, then `finish`; `wasCommitted` when that is durable.
     void begin(const std::string& program, Date date);

@@ -28,7 +28,8 @@ CREATE INDEX IF NOT EXISTS former_uid ON former(uid, replaced);
 
     void begin(); // makes the table, and is durable on return
     bool areKept();
-    // The encoded properties that the record had at that time, null when they are the present ones or not known.
+    // The encoded properties that the record had at that time, null when they are the present ones or not known. The
+    // date of a version names it whatever the clock did.
     std::shared_ptr<const Bytes> of(const UniqueId& uid, Date at);
 
     void keep(const UniqueId& uid, Date modified, Date replaced, const Bytes& properties);

@@ -54,11 +54,14 @@ std::vector<CXChangeDetail> CXHistory::details(int64_t change, const std::option
     return _rolvane.impl().changeLog.details(change, of);
 }
 
-std::optional<bool> CXHistory::wasListed(Date moment, const UniqueId& group, const UniqueId& member, bool isNow) {
+std::optional<int64_t> CXHistory::lastUntil(Date moment) {
     std::lock_guard lock(_rolvane.impl().mutex);
-    ChangeLog& log = _rolvane.impl().changeLog;
-    if (!log.reachesBackTo(moment)) return std::nullopt;
-    const auto move = log.firstMoveSince(moment, group, member);
+    return _rolvane.impl().changeLog.lastUntil(moment);
+}
+
+bool CXHistory::wasListed(int64_t change, const UniqueId& group, const UniqueId& member, bool isNow) {
+    std::lock_guard lock(_rolvane.impl().mutex);
+    const auto move = _rolvane.impl().changeLog.firstMoveBehind(change, group, member);
     return move ? *move == CXDetailKind::left : isNow;
 }
 

@@ -31,9 +31,11 @@ public:
     Dictionary after(const CXChangeDetail& detail);
     // Deleted records whose name or identifier this is, the latest deletion first, each once.
     std::vector<UniqueId> deletedNamed(const std::string& name);
-    // Were a person or a subgroup in the group at that moment? `isNow`: are they now? Nothing where the log does not
-    // reach back so far.
-    std::optional<bool> wasListed(Date moment, const UniqueId& group, const UniqueId& member, bool isNow);
+    // The number of the last change until that moment. Nothing where the log does not reach back so far, or the clock
+    // was set back from there.
+    std::optional<int64_t> lastUntil(Date moment);
+    // Was a person or a subgroup in the group behind that change? `isNow`: in the present.
+    bool wasListed(int64_t change, const UniqueId& group, const UniqueId& member, bool isNow);
     std::string nameOf(const CXChangeDetail& detail); // as it was before, or is now; else the identifier
 
     // Takes the change back, unsaved. Property by property: what was changed again since stays.
