@@ -5,9 +5,11 @@
 #include "server/HttpdTemplate.h"
 #include "server/PrivateStore.h"
 #include "server/StoreConfiguration.h"
+#include "server/UnitConfinement.h"
 
 #include <algorithm>
 #include <arpa/inet.h>
+#include <filesystem>
 
 namespace rolvane {
 
@@ -110,17 +112,18 @@ std::map<std::string, std::string> renderBooksUnits(const BooksOptions& options,
         "[Unit]\nDescription=Rolvane: hands connections on to the server of the address books\n"
         "Documentation=man:rolvane(1)\nBindsTo=rolvane-books-httpd.service\nAfter=rolvane-books-httpd.service\n\n"
         "[Service]\nExecStart=/lib/systemd/systemd-socket-proxyd --exit-idle-time=10min " +
-        numbered("127.0.0.1", inner) + "\nNoNewPrivileges=yes\nPrivateTmp=yes\n";
+        numbered("127.0.0.1", inner) + "\nProtectHome=yes\n" + unitConfinement({});
 
     // Requests carry passwords, and so would a core file.
     const std::string& state = options.stateDirectory;
-    const std::string httpd = "[Unit]\nDescription=Rolvane: server of the address books\n"
-                              "Documentation=man:rolvane(1)\nStopWhenUnneeded=yes\n\n"
-                              "[Service]\nType=forking\nPIDFile=" +
-                              pathInUnit(state) + "/run/httpd.pid\nExecStart=" + options.httpdProgram + " -d " +
-                              inUnit(state) + " -f " + inUnit(state + "/conf/httpd.conf") +
-                              " -k start\nKillMode=mixed\nTimeoutStopSec=10\nUMask=0077\nNoNewPrivileges=yes\n"
-                              "LockPersonality=yes\nLimitNOFILE=16384\nLimitCORE=0\n";
+    const std::string httpd =
+        "[Unit]\nDescription=Rolvane: server of the address books\n"
+        "Documentation=man:rolvane(1)\nStopWhenUnneeded=yes\n\n"
+        "[Service]\nType=forking\nPIDFile=" +
+        pathInUnit(state) + "/run/httpd.pid\nExecStart=" + options.httpdProgram + " -d " + inUnit(state) + " -f " +
+        inUnit(state + "/conf/httpd.conf") +
+        " -k start\nKillMode=mixed\nTimeoutStopSec=10\nLimitNOFILE=16384\nLimitCORE=0\n" +
+        unitConfinement({state, std::filesystem::path(options.database).parent_path().string(), "%t"});
     return {
         {"rolvane-books.socket", socket}, {"rolvane-books.service", service}, {"rolvane-books-httpd.service", httpd}};
 }

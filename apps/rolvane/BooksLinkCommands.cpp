@@ -6,6 +6,7 @@
 
 #include "contacts/records/Identifier.h"
 #include "foundation/Paths.h"
+#include "server/UnitConfinement.h"
 #include "server/UserUnits.h"
 
 #include <filesystem>
@@ -33,8 +34,8 @@ std::string ownProgram() {
 std::map<std::string, std::string> timerUnits() {
     return {{kService, fmt::format("[Unit]\nDescription=Rolvane: brings linked address books in step\n"
                                    "Documentation=man:rolvane(1)\n\n[Service]\nType=oneshot\n"
-                                   "ExecStart=\"{}\" books sync --quiet\nNoNewPrivileges=yes\n",
-                                   ownProgram())},
+                                   "ExecStart=\"{}\" books sync --quiet\n{}",
+                                   ownProgram(), unitConfinement({"%h", "%t"}))},
             {kTimer, "[Unit]\nDescription=Rolvane: brings linked address books in step every five minutes\n"
                      "Documentation=man:rolvane(1)\n\n[Timer]\nOnStartupSec=1min\nOnUnitActiveSec=5min\n"
                      "AccuracySec=30s\n\n[Install]\nWantedBy=timers.target\n"}};

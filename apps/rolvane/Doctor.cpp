@@ -321,7 +321,8 @@ Finding Doctor::unit() {
                        {"loaded", state->loaded},
                        {"enabled", state->enabled},
                        {"stale", state->needsReload},
-                       {"confined", state->confined}};
+                       {"confined", state->confined},
+                       {"apart", state->apart}};
     if (!state->loaded)
         return {"unit",
                 State::note,
@@ -331,10 +332,19 @@ Finding Doctor::unit() {
     if (state->needsReload)
         return {"unit", State::failed, "The unit RolvaneManager.service has changed since it was read.",
                 "systemctl --user daemon-reload", figures};
+    if (state->forbidden)
+        return {"unit", State::failed,
+                "The unit RolvaneManager.service cannot start: the kernel forbids user namespaces. The section "
+                "CONFINEMENT of its manual page has the lines that do without.",
+                "man RolvaneManager", figures};
     if (!state->confined)
         return {"unit", State::failed,
                 "The unit RolvaneManager.service does not confine the daemon: something overrides its settings.",
                 "systemctl --user cat RolvaneManager.service", figures};
+    if (!state->apart)
+        return {"unit", State::note,
+                "The unit RolvaneManager.service confines the daemon in part, without a user namespace.",
+                "man RolvaneManager", figures};
     if (!state->enabled)
         return {"unit", State::note, "The daemon does not start with your session.",
                 "systemctl --user enable RolvaneManager.socket RolvaneManager.service", figures};

@@ -9,8 +9,13 @@ UnitState unitStateFrom(const std::string& shown) {
     const auto says = [&](const std::string& line) {
         return ("\n" + shown).find("\n" + line + "\n") != std::string::npos;
     };
-    return {says("LoadState=loaded"), says("UnitFileState=enabled"), says("NeedDaemonReload=yes"),
-            says("NoNewPrivileges=yes") && says("PrivateTmp=yes")};
+    constexpr const char* kNoUserNamespace = "ExecMainStatus=217";
+    return {.loaded = says("LoadState=loaded"),
+            .enabled = says("UnitFileState=enabled"),
+            .needsReload = says("NeedDaemonReload=yes"),
+            .confined = says("NoNewPrivileges=yes"),
+            .apart = says("PrivateUsers=yes"),
+            .forbidden = says(kNoUserNamespace)};
 }
 
 std::optional<UnitState> managersUnitState() {
@@ -18,7 +23,8 @@ std::optional<UnitState> managersUnitState() {
         void operator()(FILE* pipe) const { pclose(pipe); }
     };
     const std::unique_ptr<FILE, Close> pipe(
-        popen("timeout 5 systemctl --user show -p LoadState,UnitFileState,NeedDaemonReload,NoNewPrivileges,PrivateTmp "
+        popen("timeout 5 systemctl --user show -p "
+              "LoadState,UnitFileState,NeedDaemonReload,NoNewPrivileges,PrivateUsers,ExecMainStatus "
               "RolvaneManager.service 2>/dev/null",
               "re"));
     std::string shown;

@@ -1,5 +1,7 @@
 #include "daemon/CXDProgressManager.h"
 
+#include "foundation/SignOfLife.h"
+
 namespace rolvane {
 
 void CXDProgressManager::setEngine(const RecordLocator* locator, const LocationOwner* owner) {
@@ -37,6 +39,7 @@ void CXDProgressManager::willProcessChangeRecord(const CXDChangeRecordPtr& recor
 }
 
 void CXDProgressManager::didProcessChangeRecord(const CXDChangeRecordPtr& record) {
+    signOfLife();
     std::string shown;
     double progress = 0;
     {

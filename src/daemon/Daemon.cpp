@@ -11,6 +11,7 @@
 #include "contacts/database/DamagedDatabase.h"
 #include "contacts/records/CXAllGroup.h"
 #include "daemon/BootTimer.h"
+#include "daemon/BusPresence.h"
 #include "daemon/CXDProgressManager.h"
 #include "daemon/CheckIn.h"
 #include "daemon/DesktopAlert.h"
@@ -21,14 +22,17 @@
 #include "daemon/StoreNewsRequest.h"
 #include "daemon/TerminationWatch.h"
 #include "daemon/TreesAhead.h"
+#include "daemon/Watchdog.h"
 #include "engine/CXDSyncEngine.h"
 #include "engine/pass/OutcomeKeeper.h"
 #include "engine/pass/StoreFailures.h"
 #include "foundation/BootTime.h"
+#include "foundation/BusConnection.h"
 #include "foundation/DaemonNotifications.h"
 #include "foundation/FreeMemory.h"
 #include "foundation/Log.h"
 #include "foundation/Paths.h"
+#include "foundation/SignOfLife.h"
 #include "store/account/CXNetworkController.h"
 #include "store/dav/CXDAVManager.h"
 
@@ -100,7 +104,18 @@ public:
             if (std::strcmp(argv[i], kEndWhenIdle.name) == 0) IdleExit::process().setInterval(0);
     }
 
-    void listen(const std::string& path) { _channel.listen(path); }
+    // From here on this process serves its user: on the control socket, and under its name on the bus.
+    void listen(const std::string& path) {
+        _channel.listen(path);
+        if (const auto address = sessionBusAddress()) _presence.emplace(*address);
+    }
+
+    void feedWatchdog() {
+        const auto limit = Watchdog::limitOfTheManager();
+        if (!limit) return;
+        _watchdog = std::make_shared<Watchdog>(_loop, *limit, Watchdog::platform());
+        setSignOfLifeListener([watchdog = _watchdog] { watchdog->sign(); });
+    }
 
     void openDatabase() {
         CXRolvane::Options options;
@@ -317,6 +332,8 @@ private:
     std::mt19937 _random{std::random_device()()};
     std::optional<SleepWatch> _sleep;
     RunLoop::Handle _terminated;
+    std::optional<BusPresence> _presence; // none without a session bus
+    std::shared_ptr<Watchdog> _watchdog;  // none where nobody watches
 };
 
 } // namespace
@@ -328,6 +345,7 @@ int runDaemon(int argc, char** argv) {
     std::optional<InstanceLock> lock; // outlives the daemon, whose socket lies where the next one's will
     try {
         Daemon daemon;
+        daemon.feedWatchdog();
         daemon.readDebugLevel();
         CXDLog("Parsing arguments.");
         daemon.parseArguments(argc, argv);

@@ -4,6 +4,7 @@
 
 #include "foundation/CXException.h"
 #include "server/BooksServer.h"
+#include "support/UnitExposure.h"
 #include "support/UserWorld.h"
 
 #include <csignal>
@@ -453,6 +454,7 @@ TEST_F(BooksOfAnOrdinaryUser, ALinkIsKeptInStepByATimerOfTheServiceManager) {
         return std::string(std::istreambuf_iterator<char>(file), {});
     };
     EXPECT_THAT(unit(".timer"), HasSubstr("OnUnitActiveSec=5min\n"));
+    EXPECT_TRUE(isConfined(units + ".service"));
     elsewhere.addPerson("Yan", "Later");
     const std::string service = unit(".service"), key = "ExecStart=";
     ASSERT_THAT(service, HasSubstr(key));

@@ -3,6 +3,7 @@
 #include "foundation/CXException.h"
 #include "foundation/Paths.h"
 #include "server/BooksDevices.h"
+#include "support/UnitExposure.h"
 
 #include <fstream>
 #include <gmock/gmock.h>
@@ -97,6 +98,9 @@ TEST(BooksUnits, AreWhatSystemdTakes) {
     for (const auto& [name, text] : renderBooksUnits(options, 4711, 5000, true)) {
         std::ofstream(directory.path(name)) << text;
         command.push_back(directory.path(name));
+        if (name.ends_with(".service")) {
+            EXPECT_TRUE(test::isConfined(directory.path(name)));
+        }
     }
     const CommandResult verified = runCommand(command);
     EXPECT_EQ(verified.status, 0) << verified.output << verified.errors;

@@ -2,6 +2,7 @@
 
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "foundation/SignOfLife.h"
 #include "foundation/TestSwitch.h"
 
 #include <algorithm>
@@ -25,6 +26,7 @@ bool isStoreScheme(std::string_view scheme) {
 
 // What goes wrong on the renewal thread is a renewal that failed, and no more.
 bool renews(CXWebDAVLock& lock) {
+    const WithoutSignsOfLife beside; // the pass that holds the lock may be stuck
     try {
         return lock.renew();
     } catch (const CXException& e) {

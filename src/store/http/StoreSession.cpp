@@ -2,6 +2,7 @@
 
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "foundation/SignOfLife.h"
 #include "foundation/TestSwitch.h"
 #include "store/dav/Collections.h"
 #include "store/dav/Multistatus.h"
@@ -244,6 +245,7 @@ bool StoreSession::hasDone(const HttpRequest& asked) {
 }
 
 HttpResponse StoreSession::judged(const HttpRequest& asked, HttpResponse answer, Handled handled) {
+    signOfLife();
     HttpResponse heeded = believed(asked, followed(asked, std::move(answer)));
     const bool succeeded = heeded.ok() || (heeded.status == 207 && asked.method == "PROPFIND");
     if (!succeeded && !(heeded.complete() && handled && handled(heeded.status)))
