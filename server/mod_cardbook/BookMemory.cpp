@@ -8,8 +8,9 @@
 namespace rolvane::cardbook {
 namespace {
 
-// 1 had no table joined; in 2, looks were noted of devices that had been told of tags alone; 3 had no table waiting
-constexpr int kFormat = 4;
+// 1 had no table joined; in 2, looks were noted of devices that had been told of tags alone; 3 had no table waiting, 4
+// no table told
+constexpr int kFormat = 5;
 constexpr const char* kTables = R"(
 CREATE TABLE meta(key TEXT PRIMARY KEY, value) WITHOUT ROWID;
 CREATE TABLE books(id INTEGER PRIMARY KEY, book TEXT NOT NULL UNIQUE, seq INTEGER NOT NULL, begun INTEGER NOT NULL,
@@ -38,6 +39,9 @@ constexpr const char* kJoinedTable = R"(
 CREATE TABLE joined(key TEXT NOT NULL, uid TEXT NOT NULL, PRIMARY KEY(key, uid)) WITHOUT ROWID;
 CREATE INDEX joined_uid ON joined(uid);
 )";
+constexpr const char* kToldTable = R"(
+CREATE TABLE told(device TEXT NOT NULL, book TEXT NOT NULL, uid TEXT NOT NULL, seq INTEGER NOT NULL, PRIMARY KEY(device, book, uid)) WITHOUT ROWID;
+)";
 constexpr const char* kWaitingTable = R"(
 CREATE TABLE waiting(key TEXT NOT NULL, uid TEXT NOT NULL, PRIMARY KEY(key, uid)) WITHOUT ROWID;
 CREATE INDEX waiting_uid ON waiting(uid);
@@ -59,10 +63,11 @@ BookMemory::BookMemory(const std::string& path, int busyTimeoutMilliseconds, int
         throw CXException(kCXDatabaseException, path + " was written by a newer version of this program.");
     if (format == kFormat) return; // another process was faster
     if (format < 2) _sqlite.execute(kJoinedTable);
-    _sqlite.execute(kWaitingTable);
+    if (format < 4) _sqlite.execute(kWaitingTable);
+    _sqlite.execute(kToldTable);
     _sqlite.execute("PRAGMA user_version=" + std::to_string(kFormat));
     if (format > 0) {
-        _sqlite.execute("DELETE FROM meta WHERE key='position'"); // everybody is looked at once more
+        if (format < 4) _sqlite.execute("DELETE FROM meta WHERE key='position'"); // everybody is looked at once more
         if (format < 3) _sqlite.execute("DELETE FROM looks");
         transaction.commit();
         return;
@@ -157,6 +162,13 @@ std::optional<Member> BookMemory::of(std::string_view book, const UniqueId& uid)
     auto s = _sqlite.statement("SELECT uid, name, modified, seq, gone FROM members "
                                "WHERE book=(SELECT id FROM books WHERE book=?1) AND uid=?2 AND NOT gone");
     if (!s.bind(1, book).bind(2, uid.str()).step()) return std::nullopt;
+    return memberAt(s);
+}
+
+std::optional<Member> BookMemory::departed(std::string_view book, std::string_view name) {
+    auto s = _sqlite.statement("SELECT uid, name, modified, seq, gone FROM members "
+                               "WHERE book=(SELECT id FROM books WHERE book=?1) AND name=?2 AND gone");
+    if (!s.bind(1, book).bind(2, name).step()) return std::nullopt;
     return memberAt(s);
 }
 
@@ -274,6 +286,7 @@ void BookMemory::noteBookGone(std::string_view book) {
     const int64_t number = numberOf(book, false);
     _sqlite.statement("DELETE FROM members WHERE book=?").bind(1, number).run();
     _sqlite.statement("DELETE FROM wishes WHERE book=?").bind(1, number).run();
+    _sqlite.statement("DELETE FROM told WHERE book=?").bind(1, book).run();
     _sqlite.statement("DELETE FROM books WHERE id=?").bind(1, number).run();
     _sqlite.execute("DELETE FROM written WHERE NOT EXISTS "
                     "(SELECT 1 FROM members m WHERE m.uid=written.uid AND NOT m.gone)");
@@ -309,6 +322,7 @@ void BookMemory::forgetOldDepartures() {
         .bind(1, until)
         .run();
     _sqlite.statement("DELETE FROM members WHERE gone AND seq<=?").bind(1, until).run();
+    _sqlite.statement("DELETE FROM told WHERE uid<>'' AND seq<=?").bind(1, until).run();
 }
 
 void BookMemory::beginComparison() {

@@ -49,6 +49,7 @@ public:
 
     std::optional<Member> named(std::string_view book, std::string_view name); // never one that has left
     std::optional<Member> of(std::string_view book, const UniqueId& uid);
+    std::optional<Member> departed(std::string_view book, std::string_view name); // one that has left, lately
     // Those behind a number, in its order.
     std::vector<Member> after(std::string_view book, int64_t sequence, bool withGone, size_t limit);
     std::vector<std::string> booksWith(const UniqueId& uid); // in which it is

@@ -61,9 +61,14 @@ private:
 CardWriter::CardWriter(Library& library, WriteContext context)
     : _library(library), _rolvane(library.rolvane()), _memory(library.memory()), _c(std::move(context)) {}
 
-// The card of the name now, for which the conditions hold.
+// The card of the name now, for which the conditions hold, in the book as it is now: a subscription may have ended
+// since the request began, or the right to write.
 std::optional<Member> CardWriter::settle() {
     _library.catchUp();
+    auto book = _library.book(_c.book.id);
+    if (!book) throw Refused(404, "There is no such book any more.");
+    _c.book = std::move(*book);
+    requireWritable(_c.book);
     const auto now = _memory.named(_c.book.id, _c.name);
     const bool isSame = now && _c.judged && now->uid == _c.judged->uid && now->modified == _c.judged->modified;
     const bool isNeither = !now && !_c.judged;
@@ -77,6 +82,36 @@ void CardWriter::requireWritable(const Book& book) const {
     throw Refused(403, kDavSpace, "need-privileges", "Whoever shares these contacts does not let you write.",
                   "<D:resource><D:href>" + xmlText(path) +
                       "</D:href><D:privilege><D:write/></D:privilege></D:resource>");
+}
+
+// Where one deletes and the other edits, the deletion stands. The device is told so by this refusal, and may write the
+// card anew afterwards.
+void CardWriter::refuseToBringBack(const ClientCard& card) {
+    const auto left = _memory.departed(_c.book.id, _c.name);
+    if (!left || vcardMemberKey(cxUUIDPart(left->uid)) != vcardMemberKey(card.entity.uid)) return;
+    Devices devices(_memory);
+    if (!devices.isUnawareOf(_c.device, _c.book.id, *left)) return;
+    devices.noteTold(_c.device, _c.book.id, *left);
+    throw Refused(412, "Somebody else has taken the card out of the book meanwhile.");
+}
+
+void CardWriter::noteTakenOut() {
+    if (const auto left = _memory.departed(_c.book.id, _c.name))
+        Devices(_memory).noteTold(_c.device, _c.book.id, *left);
+}
+
+// A card that is saved into a subscription which ends at that moment would never be removed. One for a group that is
+// deleted then would stay as somebody of no group.
+void CardWriter::expectBook(std::vector<CXExpected>& expected) {
+    CXRecordRef of;
+    if (_c.book.kind == Book::Kind::shared)
+        of = _rolvane.findSubscriptionWithRemoteLocation(_c.book.location);
+    else if (_c.book.kind == Book::Kind::group)
+        of = groupOf(_c.book);
+    else
+        return;
+    if (!of) throw Refused(404, "There is no such book any more.");
+    expected.push_back({of->uniqueId(), of->valueForProperty(kCXModificationDateProperty).date()});
 }
 
 void CardWriter::wish(const Book& book, const UniqueId& uid, const std::string& name) {
@@ -173,6 +208,7 @@ Written CardWriter::put(const std::string& text) {
     const Turn turn(bookMemoryPath(_rolvane.path()) + ".lock");
     for (int round = 0; round < kRounds; ++round) {
         const auto now = settle();
+        if (!now && !_c.conditions.isAbsent) refuseToBringBack(card);
         const auto written = card.entity.isGroup ? putGroup(card, now) : putPerson(card, now);
         if (!written) continue;
         Devices(_memory).noteKnowledge(_c.device, knowledgeOf(card));
@@ -226,6 +262,7 @@ std::optional<Written> CardWriter::putPerson(const ClientCard& card, const std::
         expected.push_back({person->uniqueId(), std::nullopt});
         if (!isShared) joinGroupsThatWaitFor(person, card.entity.uid);
     }
+    expectBook(expected);
     if (_c.book.kind == Book::Kind::group) groupOf(_c.book)->addMember(person);
     const UniqueId uid = person->uniqueId();
     const auto encoded = person->encodedRepresentation();
@@ -387,7 +424,7 @@ void CardWriter::remove() {
         if (!now) throw Refused(404, "The card has gone already.");
         if (_c.book.kind == Book::Kind::shared && isGroupRecord(now->uid))
             throw notHere("Groups of other people stay theirs.");
-        if (removeIfStill(*now)) return;
+        if (removeIfStill(*now)) return noteTakenOut();
     }
     throw savedAgainAndAgain();
 }
@@ -459,6 +496,7 @@ bool CardWriter::move(const Book& to, const std::string& name, bool mayReplace) 
     const auto now = _memory.named(_c.book.id, _c.name);
     if (now) groupOf(_c.book)->removeMember(std::dynamic_pointer_cast<CXPerson>(_rolvane.recordForUniqueId(now->uid)));
     save();
+    noteTakenOut();
     return made;
 }
 

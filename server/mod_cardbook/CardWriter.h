@@ -57,6 +57,9 @@ private:
     class Turn; // of a writer
     std::optional<Member> settle();
     void requireWritable(const Book& book) const;
+    void refuseToBringBack(const ClientCard& card);
+    void noteTakenOut();
+    void expectBook(std::vector<CXExpected>& expected);
     static std::vector<UniqueId> spellingsOf(const std::string& uid, std::string_view table);
     CXRecordRef recordOf(const std::string& uid, std::string_view table);
     [[noreturn]] void conflict(const Member& other, const std::string& book = {}); // in that book, else in this one

@@ -24,6 +24,41 @@ void Devices::noteHad(const std::string& device, const std::vector<std::pair<Uni
     transaction.commit();
 }
 
+int64_t Devices::toldOf(const std::string& device, const std::string& book, std::string_view uid) {
+    auto s = _sqlite.statement("SELECT seq FROM told WHERE device=?1 AND book=?2 AND uid=?3");
+    return s.bind(1, device).bind(2, book).bind(3, uid).step() ? s.integer(0) : -1;
+}
+
+// Nothing is written where nothing has left since.
+void Devices::noteListed(const std::string& device, const std::string& book, int64_t sequence) {
+    const int64_t known = toldOf(device, book, "");
+    if (known >= sequence) return;
+    if (known >= 0) {
+        auto left =
+            _sqlite.statement("SELECT 1 FROM members INDEXED BY members_gone WHERE gone AND seq>?1 AND seq<=?2 AND "
+                              "book=(SELECT id FROM books WHERE book=?3) LIMIT 1");
+        if (!left.bind(1, known).bind(2, sequence).bind(3, book).step()) return;
+    }
+    auto s = _sqlite.statement("INSERT OR REPLACE INTO told VALUES(?,?,'',?)");
+    s.bind(1, device).bind(2, book).bind(3, sequence).run();
+}
+
+void Devices::noteTold(const std::string& device, const std::string& book, const Member& departed) {
+    if (toldOf(device, book, "") >= departed.sequence || toldOf(device, book, departed.uid.str()) >= departed.sequence)
+        return;
+    auto s = _sqlite.statement("INSERT OR REPLACE INTO told VALUES(?,?,?,?)");
+    s.bind(1, device).bind(2, book).bind(3, departed.uid.str()).bind(4, departed.sequence).run();
+}
+
+// Who never looked into the book has had none of its cards.
+bool Devices::isUnawareOf(const std::string& device, const std::string& book, const Member& departed) {
+    const int64_t looked = lookedAt(device, book), listed = toldOf(device, book, "");
+    if (looked < 0 && listed < 0) return false;
+    if (listed >= departed.sequence || toldOf(device, book, departed.uid.str()) >= departed.sequence) return false;
+    auto s = _sqlite.statement("SELECT 1 FROM had WHERE device=?1 AND uid=?2");
+    return looked >= 0 || s.bind(1, device).bind(2, departed.uid.str()).step();
+}
+
 void Devices::noteKnowledge(const std::string& device, const std::set<std::string>& properties) {
     const std::vector<std::string> fresh = unknown(device, properties);
     if (fresh.empty()) return;

@@ -17,6 +17,12 @@ public:
     void noteLook(const std::string& device, const std::string& book, int64_t sequence, Date when);
     // The device was sent these cards, each of that state.
     void noteHad(const std::string& device, const std::vector<std::pair<UniqueId, Date>>& cards);
+    // The device was told of everything that had left the book until that number.
+    void noteListed(const std::string& device, const std::string& book, int64_t sequence);
+    // The device was told that this card has left, or has taken it out itself.
+    void noteTold(const std::string& device, const std::string& book, const Member& departed);
+    // Has the device had the card, which somebody else has taken out of the book without its knowing?
+    bool isUnawareOf(const std::string& device, const std::string& book, const Member& departed);
     void noteKnowledge(const std::string& device, const std::set<std::string>& properties);
     // False where the device would understand more properties than any program does.
     bool mayLearn(const std::string& device, const std::set<std::string>& properties);
@@ -36,6 +42,7 @@ public:
     }
 
 private:
+    int64_t toldOf(const std::string& device, const std::string& book, std::string_view uid); // else -1
     std::vector<std::string> unknown(const std::string& device, const std::set<std::string>& properties);
 
     Sqlite& _sqlite;

@@ -53,6 +53,8 @@ private:
             const bool isHere = place && place->kind == Place::Kind::card && place->book == book();
             auto member = isHere ? _library.memory().named(book(), place->name) : std::nullopt;
             if (!member) {
+                const auto left = isHere ? _library.memory().departed(book(), place->name) : std::nullopt;
+                if (left) _departed.push_back(*left);
                 flush();
                 _answer.add("<D:response><D:href>" + xmlText(href) + "</D:href>" + statusLine(HTTP_NOT_FOUND) +
                             "</D:response>\n");
@@ -86,8 +88,9 @@ private:
         });
         if (isCut)
             _answer.addStatus(_resource.path(), HTTP_INSUFFICIENT_STORAGE, "<D:number-of-matches-within-limits/>");
-        else if (_request.filter.isEverything() && sendsWholeCards())
-            _sentUntil = latest;
+        else if (_request.filter.isEverything())
+            _listedUntil = latest;
+        if (_listedUntil && sendsWholeCards()) _sentUntil = latest;
     }
 
     void sync() {
@@ -113,6 +116,7 @@ private:
         if (isCut)
             _answer.addStatus(_resource.path(), HTTP_INSUFFICIENT_STORAGE, "<D:number-of-matches-within-limits/>");
         _answer.add("<D:sync-token>" + syncToken(_library, until) + "</D:sync-token>\n");
+        _listedUntil = until;
         const bool hasFormerOnes = isFirst || Devices(memory).lookedAt(_resource.r->user, book()) >= from;
         if (sendsWholeCards() && hasFormerOnes) _sentUntil = until;
     }
@@ -173,6 +177,8 @@ private:
             devices.noteLook(_resource.r->user, book(), *_sentUntil,
                              Date(static_cast<double>(_resource.r->request_time) / 1e6));
         devices.noteHad(_resource.r->user, _sent);
+        if (_listedUntil) devices.noteListed(_resource.r->user, book(), *_listedUntil);
+        for (const Member& departed : _departed) devices.noteTold(_resource.r->user, book(), departed);
     }
 
     void sendCard(const Member& member, const Card& card) {
@@ -214,6 +220,8 @@ private:
     std::optional<int64_t> _lastSent, _lookedAt;
     std::optional<int64_t> _sentUntil;            // all cards of the book as it was at that number
     std::vector<std::pair<UniqueId, Date>> _sent; // others
+    std::optional<int64_t> _listedUntil;          // who is in the book and who has left, up to that number
+    std::vector<Member> _departed;                // others
 };
 
 } // namespace

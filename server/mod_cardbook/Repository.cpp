@@ -23,12 +23,21 @@ Resource resourceAt(request_rec* r, const std::string& base, const Place& place)
     return it;
 }
 
+// Whoever asks for a card that has left its book is going to be told so.
+void noteAskedInVain(const Resource& it) {
+    if (it.r->method_number != M_GET || it.place.kind != Place::Kind::card || !it.book || it.member) return;
+    BookMemory& memory = it.library->memory();
+    if (const auto left = memory.departed(it.place.book, it.place.name))
+        Devices(memory).noteTold(it.r->user, it.place.book, *left);
+}
+
 dav_error* getResource(request_rec* r, const char* root, const char*, int, dav_resource** resource) noexcept {
     return contained(r, [&] {
         std::string base = root ? root : "";
         while (base.ends_with('/')) base.pop_back();
         const auto place = placeOf(base, r->uri);
         *resource = newResource(r->pool, resourceAt(r, base, place.value_or(Place{})));
+        contained(r, [&] { noteAskedInVain(of(*resource)); });
     });
 }
 
@@ -126,11 +135,13 @@ dav_error* deliver(const dav_resource* resource, ap_filter_t* output) noexcept {
     if (ap_pass_brigade(output, brigade) != APR_SUCCESS)
         return dav_new_error(resource->pool, HTTP_INTERNAL_SERVER_ERROR, 0, 0, "The answer could not be sent.");
     if (!it.card) return nullptr;
-    return contained(it.r, [&] {
+    // A note that fails is in the log. The answer has ended, and an error would be written behind it.
+    contained(it.r, [&] {
         Devices devices(it.library->memory());
         if (!devices.isCoveredByLook(it.r->user, it.place.book, *it.member))
             devices.noteHad(it.r->user, {{it.member->uid, it.card->modified}});
     });
+    return nullptr;
 }
 
 // Visits a collection and, where asked, what is in it. The members of a book are made one at a time.
@@ -170,8 +181,19 @@ private:
     }
 
     dav_error* visitMembers(const Resource& book) {
+        int64_t latest = 0;
+        dav_error* error = visitMembersOfOneMoment(book, latest);
+        // A note that fails is in the log.
+        if (!error)
+            contained(book.r,
+                      [&] { Devices(book.library->memory()).noteListed(book.r->user, book.place.book, latest); });
+        return error;
+    }
+
+    dav_error* visitMembersOfOneMoment(const Resource& book, int64_t& latest) {
         constexpr size_t kPage = 500;
         const SqliteSnapshot moment(book.library->memory().sqlite());
+        latest = book.library->memory().latest(book.place.book);
         apr_pool_t* pool = nullptr;
         apr_pool_create(&pool, _parameters.pool);
         dav_error* error = nullptr;

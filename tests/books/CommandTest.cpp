@@ -2,6 +2,7 @@
 
 #include "BooksWorld.h"
 
+#include "foundation/Base64.h"
 #include "foundation/CXException.h"
 #include "server/BooksServer.h"
 #include "support/UnitExposure.h"
@@ -147,6 +148,28 @@ TEST_F(BooksCommand, ADeviceThatIsRemovedOrGotAnotherPasswordIsRefusedAtTheNextR
     EXPECT_EQ(status("phone", second), "401");
     EXPECT_EQ(status("laptop", laptop), "207");
     EXPECT_EQ(world.rolvane({"books", "device", "remove", "phone"}).status, 3);
+}
+
+// Its request that is under way is answered, as the device was let in. The next one is not.
+TEST_F(BooksCommand, ADeviceThatIsRemovedInTheMiddleOfARequestMakesNoOther) {
+    const int port = json({"books", "on", "--no-tls"})["port"];
+    const std::string login = "phone:" + addDevice("phone");
+    std::string authorization = "Basic ";
+    appendBase64(reinterpret_cast<const uint8_t*>(login.data()), login.size(), authorization);
+    const RawRequest request{
+        "",
+        "REPORT",
+        "/books/home/contacts/",
+        {{"Authorization", authorization}, {"Content-Type", "application/xml"}, {"Expect", "100-continue"}},
+        "<sync-collection xmlns=\"DAV:\"><sync-token/><sync-level>1</sync-level><prop><getetag/></prop>"
+        "</sync-collection>"};
+    RawUpload sync(port, request, 0);
+    ASSERT_TRUE(sync.awaitContinue());
+    done({"books", "device", "remove", "phone"});
+    const RawAnswer answer = sync.finish();
+    EXPECT_EQ(answer.status, 207);
+    EXPECT_THAT(answer.body, HasSubstr("</D:multistatus>"));
+    EXPECT_EQ(rawRequest(port, request).status, 401);
 }
 
 TEST_F(BooksCommand, TellWhenADeviceWasThereLast) {

@@ -117,6 +117,7 @@ def evolution(person, check):
         server.wait(lambda cards: has(cards, "FN:Ann Lee") and has(cards, "FN:Bob Lee"), "two contacts")
         both_ways(person, server, check)
         older_edit(person, server, check)
+        edit_of_the_deleted(person, server, check)
         offline(person, server, check)
         cards = server.cards()
         people = [card for card in cards.values() if "KIND:group" not in card]
@@ -167,6 +168,21 @@ def older_edit(person, server, check):
           "an edit of an older version there takes nothing of the newer one here")
     server.wait(lambda cards: has(cards, "FN:Bob Lee", "NOTE:newer", "NICKNAME:Bobby"), "what both have changed")
     check(True, "and there it has both, too")
+
+
+def edit_of_the_deleted(person, server, check):
+    person.run("add", "--first", "Una", "--last", "Lee")
+    server.wait(lambda cards: has(cards, "FN:Una Lee"), "who is added here")
+    uid = server.uid_of("Una Lee")
+    person.run("delete", "Una Lee", "--yes")
+    try:
+        server.ask("change", uid, "nickname", "Uni")
+        said = ""
+    except Failure as failure:
+        said = str(failure)
+    check(said and person.json("list", "Una Lee") == [],
+          f"an edit there of somebody who was deleted here brings nobody back, and is told: {said}")
+    server.wait(lambda cards: not has(cards, "FN:Una Lee"), "who is deleted here")
 
 
 def offline(person, server, check):

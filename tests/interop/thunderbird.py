@@ -209,6 +209,7 @@ def thunderbird(person, check):
         check(len(program.cards("Friends")) == 1, "the group's book has its member")
         both_ways(person, program, check)
         older_edit(person, program, check)
+        edit_of_the_deleted(person, program, check)
         offline(person, program, check)
         of_group(person, program, check)
         forgotten(person, program, check)
@@ -253,6 +254,17 @@ def older_edit(person, program, check):
     program.sync("Contacts")
     card = program.cards("Contacts")[uid]
     check("NOTE:newer" in card and "NICKNAME:Bobby" in card, "and there it has both, too")
+
+
+def edit_of_the_deleted(person, program, check):
+    person.run("add", "--first", "Una", "--last", "Lee")
+    program.sync("Contacts")
+    uid = uid_of(program.cards("Contacts"), "Una Lee")
+    person.run("delete", "Una Lee", "--yes")
+    program.change("Contacts", uid, "NICKNAME:Uni")
+    program.sync("Contacts")
+    check(person.json("list", "Una Lee") == [] and uid not in program.cards("Contacts"),
+          "an edit there of somebody who was deleted here brings nobody back")
 
 
 def offline(person, program, check):
