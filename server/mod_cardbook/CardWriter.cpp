@@ -84,14 +84,12 @@ void CardWriter::requireWritable(const Book& book) const {
                       "</D:href><D:privilege><D:write/></D:privilege></D:resource>");
 }
 
-// Where one deletes and the other edits, the deletion stands. The device is told so by this refusal, and may write the
-// card anew afterwards.
+// Where one deletes and the other edits, the deletion stands. A device that has been told of it by an answer to its own
+// question may write the card anew. This refusal tells nothing yet: programs repeat what has failed without looking.
 void CardWriter::refuseToBringBack(const ClientCard& card) {
     const auto left = _memory.departed(_c.book.id, _c.name);
     if (!left || vcardMemberKey(cxUUIDPart(left->uid)) != vcardMemberKey(card.entity.uid)) return;
-    Devices devices(_memory);
-    if (!devices.isUnawareOf(_c.device, _c.book.id, *left)) return;
-    devices.noteTold(_c.device, _c.book.id, *left);
+    if (!Devices(_memory).isUnawareOf(_c.device, _c.book.id, *left)) return;
     throw Refused(412, "Somebody else has taken the card out of the book meanwhile.");
 }
 

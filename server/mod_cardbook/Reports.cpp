@@ -42,6 +42,7 @@ private:
 
     // RFC 6352 section 8.7. Names are looked up page by page, so that the answer begins at once.
     void multiget() {
+        _notesEach = sendsWholeCards();
         std::vector<Member> page;
         const auto flush = [&] {
             send(page);
@@ -70,6 +71,7 @@ private:
         const SqliteSnapshot moment(_library.memory().sqlite());
         const auto asked =
             _request.filter.isEverything() ? version() : std::optional(version().value_or(VCardVersion::v3));
+        _notesEach = sendsWholeCards() && (_request.limit || !_request.filter.isEverything());
         uint64_t left = std::min<uint64_t>(_request.limit.value_or(kMostResponses), kMostResponses);
         size_t bytes = 0;
         bool isCut = false;
@@ -83,6 +85,7 @@ private:
                 }
                 --left;
                 sendCard(member, *card);
+                noteHad(member, *card);
             });
             return !isCut;
         });
@@ -98,6 +101,8 @@ private:
         const SqliteSnapshot moment(memory.sqlite());
         const bool isFirst = _request.token.empty();
         const int64_t from = isFirst ? 0 : numberOfToken(_library, book(), _request.token, refusalOfToken());
+        const bool hasFormerOnes = isFirst || Devices(memory).lookedAt(_resource.r->user, book()) >= from;
+        _notesEach = sendsWholeCards() && !hasFormerOnes;
         int64_t until = memory.latest(book());
         uint64_t left = std::min<uint64_t>(_request.limit.value_or(kMostResponses), kMostResponses);
         bool isCut = false;
@@ -117,7 +122,6 @@ private:
             _answer.addStatus(_resource.path(), HTTP_INSUFFICIENT_STORAGE, "<D:number-of-matches-within-limits/>");
         _answer.add("<D:sync-token>" + syncToken(_library, until) + "</D:sync-token>\n");
         _listedUntil = until;
-        const bool hasFormerOnes = isFirst || Devices(memory).lookedAt(_resource.r->user, book()) >= from;
         if (sendsWholeCards() && hasFormerOnes) _sentUntil = until;
     }
 
@@ -163,9 +167,9 @@ private:
 
     bool sendsWholeCards() const { return _request.data && _request.data->lines.empty(); }
 
-    // Of a multiget; whoever is sent a whole book has all of its cards.
+    // Whoever is sent a whole book has all of its cards, and needs no note of each.
     void noteHad(const Member& member, const Card& card) {
-        if (_request.kind != ReportRequest::Kind::multiget || !sendsWholeCards()) return;
+        if (!_notesEach) return;
         if (!_lookedAt) _lookedAt = Devices(_library.memory()).lookedAt(_resource.r->user, book());
         if (member.sequence > *_lookedAt) _sent.emplace_back(member.uid, card.modified);
     }
@@ -218,6 +222,7 @@ private:
     const ReportRequest& _request;
     Multistatus _answer;
     std::optional<int64_t> _lastSent, _lookedAt;
+    bool _notesEach = false;
     std::optional<int64_t> _sentUntil;            // all cards of the book as it was at that number
     std::vector<std::pair<UniqueId, Date>> _sent; // others
     std::optional<int64_t> _listedUntil;          // who is in the book and who has left, up to that number

@@ -173,20 +173,26 @@ TEST(Put, WithoutATagByADeviceThatReadTagsAloneTakesNothingAway) {
 }
 
 TEST(Put, WithoutATagTakesAwayWhatTheDeviceHasReadByWhateverRequest) {
-    const std::string query =
-        "<C:addressbook-query xmlns:D=\"DAV:\" xmlns:C=\"urn:ietf:params:xml:ns:carddav\"><D:prop>"
-        "<C:address-data/></D:prop><C:filter/></C:addressbook-query>";
-    const std::string sync = "<D:sync-collection xmlns:D=\"DAV:\" xmlns:C=\"urn:ietf:params:xml:ns:carddav\">"
-                             "<D:sync-token/><D:sync-level>1</D:sync-level><D:prop><C:address-data/></D:prop>"
-                             "</D:sync-collection>";
-    for (int way = 0; way < 4; ++way) {
+    const auto query = [](const std::string& conditions) {
+        return "<C:addressbook-query xmlns:D=\"DAV:\" xmlns:C=\"urn:ietf:params:xml:ns:carddav\"><D:prop>"
+               "<C:address-data/></D:prop><C:filter>" +
+               conditions + "</C:filter></C:addressbook-query>";
+    };
+    const auto sync = [](const std::string& token) {
+        return "<D:sync-collection xmlns:D=\"DAV:\" xmlns:C=\"urn:ietf:params:xml:ns:carddav\"><D:sync-token>" + token +
+               "</D:sync-token><D:sync-level>1</D:sync-level><D:prop><C:address-data/></D:prop></D:sync-collection>";
+    };
+    for (int way = 0; way < 6; ++way) {
         BooksWorld world;
+        const std::string begun = world.sync(kContacts, "").syncToken(); // of tags alone
         const auto ann = world.addPerson("Ann", "Lee", {{kCXNoteProperty, "so"}});
         const std::string path = at(BooksWorld::uuidOf(ann) + ".vcf"), uid = "urn:uuid:" + BooksWorld::uuidOf(ann);
         if (way == 0) world.ask("GET", path);
         if (way == 1) world.multiget(kContacts, {path});
-        if (way == 2) world.report(kContacts, query);
-        if (way == 3) world.report(kContacts, sync);
+        if (way == 2) world.report(kContacts, query(""));
+        if (way == 3) world.report(kContacts, sync(""));
+        if (way == 4) world.report(kContacts, query("<C:prop-filter name=\"FN\"/>"));
+        if (way == 5) world.report(kContacts, sync(begun));
         EXPECT_EQ(world.put(path, cardOf(uid, "Ann", "Lee")).status, 204);
         EXPECT_FALSE(ann->valueForProperty(kCXNoteProperty)) << way;
     }
