@@ -43,9 +43,11 @@ def walk(person, screen, target):
     while answered < 2:
         window = screen.window(ASKED)
         if screen.tool("xdotool", "getwindowname", window).decode().startswith("Certificate"):
-            screen.picture(os.path.join(target, "evolution-3-certificate.png"))
             screen.tool("xdotool", "windowactivate", "--sync", window)
-            screen.click(625, 197, window)  # Accept Permanently
+            # So large that the fingerprint is seen.
+            screen.tool("xdotool", "windowmove", window, "15", "30", "windowsize", window, "720", "640")
+            screen.picture(os.path.join(target, "evolution-3-certificate.png"))
+            screen.click(641, 665)  # Accept Permanently
         else:
             screen.tool("xdotool", "windowactivate", "--sync", window)
             screen.click(340, 179, window)

@@ -100,16 +100,16 @@ void CardWriter::noteTakenOut() {
 
 // A card that is saved into a subscription which ends at that moment would never be removed. One for a group that is
 // deleted then would stay as somebody of no group.
-void CardWriter::expectBook(std::vector<CXExpected>& expected) {
+std::vector<CXExpected> CardWriter::expectedOfBook() {
     CXRecordRef of;
     if (_c.book.kind == Book::Kind::shared)
         of = _rolvane.findSubscriptionWithRemoteLocation(_c.book.location);
     else if (_c.book.kind == Book::Kind::group)
         of = groupOf(_c.book);
     else
-        return;
+        return {};
     if (!of) throw Refused(404, "There is no such book any more.");
-    expected.push_back({of->uniqueId(), of->valueForProperty(kCXModificationDateProperty).date()});
+    return {{of->uniqueId(), of->valueForProperty(kCXModificationDateProperty).date()}};
 }
 
 void CardWriter::wish(const Book& book, const UniqueId& uid, const std::string& name) {
@@ -234,6 +234,7 @@ void CardWriter::apply(const CXPersonRef& person, const Dictionary& before, cons
 }
 
 std::optional<Written> CardWriter::putPerson(const ClientCard& card, const std::optional<Member>& now) {
+    const std::vector<CXExpected> ofBook = expectedOfBook(); // before a change of this request gives it another date
     auto person = std::dynamic_pointer_cast<CXPerson>(target(card, now));
     const bool isShared = _c.book.kind == Book::Kind::shared;
     std::vector<CXExpected> expected;
@@ -260,7 +261,7 @@ std::optional<Written> CardWriter::putPerson(const ClientCard& card, const std::
         expected.push_back({person->uniqueId(), std::nullopt});
         if (!isShared) joinGroupsThatWaitFor(person, card.entity.uid);
     }
-    expectBook(expected);
+    expected.insert(expected.end(), ofBook.begin(), ofBook.end());
     if (_c.book.kind == Book::Kind::group) groupOf(_c.book)->addMember(person);
     const UniqueId uid = person->uniqueId();
     const auto encoded = person->encodedRepresentation();

@@ -59,7 +59,7 @@ private:
     void requireWritable(const Book& book) const;
     void refuseToBringBack(const ClientCard& card);
     void noteTakenOut();
-    void expectBook(std::vector<CXExpected>& expected);
+    std::vector<CXExpected> expectedOfBook();
     static std::vector<UniqueId> spellingsOf(const std::string& uid, std::string_view table);
     CXRecordRef recordOf(const std::string& uid, std::string_view table);
     [[noreturn]] void conflict(const Member& other, const std::string& book = {}); // in that book, else in this one

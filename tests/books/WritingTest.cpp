@@ -413,6 +413,19 @@ TEST(Groups, AreJoinedByMembersWhoseCardsComeLater) {
     EXPECT_THAT(served, HasSubstr("MEMBER:urn:uuid:" + kUUID + "\r\n"));
 }
 
+TEST(GroupBooks, TakeTheVeryMemberThatTheGroupWaitsFor) {
+    BooksWorld world;
+    const std::string card = "BEGIN:VCARD\r\nVERSION:4.0\r\nKIND:group\r\nUID:urn:uuid:" + kUUID +
+                             "\r\nFN:Friends\r\nMEMBER:late\r\nEND:VCARD\r\n";
+    ASSERT_EQ(world.put(at("friends.vcf"), card).status, 201);
+    const auto group =
+        std::dynamic_pointer_cast<CXGroup>(world.rolvane().recordForUniqueId(UniqueId(kUUID + ":CXGroup")));
+    ASSERT_TRUE(group);
+    EXPECT_EQ(world.put(at("late.vcf", bookOf(group)), cardOf("late", "Late", "Comer")).status, 201) << world.log();
+    EXPECT_EQ(group->memberCount(), 1u);
+    EXPECT_EQ(world.ask("GET", at("friends.vcf")).body, card);
+}
+
 // Of each member, what one of the two has changed since the device read the card stands.
 TEST(Groups, AreMergedMemberByMemberWithAnOlderCardThatComesWithoutATag) {
     BooksWorld world;
