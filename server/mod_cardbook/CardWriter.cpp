@@ -84,13 +84,24 @@ void CardWriter::requireWritable(const Book& book) const {
                       "</D:href><D:privilege><D:write/></D:privilege></D:resource>");
 }
 
-// Where one deletes and the other edits, the deletion stands. A device that has been told of it by an answer to its own
-// question may write the card anew. This refusal tells nothing yet: programs repeat what has failed without looking.
-void CardWriter::refuseToBringBack(const ClientCard& card) {
-    const auto left = _memory.departed(_c.book.id, _c.name);
-    if (!left || vcardMemberKey(cxUUIDPart(left->uid)) != vcardMemberKey(card.entity.uid)) return;
-    if (!Devices(_memory).isUnawareOf(_c.device, _c.book.id, *left)) return;
-    throw Refused(412, "Somebody else has taken the card out of the book meanwhile.");
+// The card that somebody else has taken out of the book, and that the device, not knowing, would bring back: where one
+// deletes and the other edits, the deletion stands. A device that has been told of it by an answer to its own question
+// may write the card anew. A refusal tells nothing yet: programs repeat what has failed without looking.
+std::optional<Member> CardWriter::toBeBroughtBack(const ClientCard& card) {
+    auto left = _memory.departed(_c.book.id, _c.name);
+    if (!left || vcardMemberKey(cxUUIDPart(left->uid)) != vcardMemberKey(card.entity.uid)) return std::nullopt;
+    if (!Devices(_memory).isUnawareOf(_c.device, _c.book.id, *left)) return std::nullopt;
+    return left;
+}
+
+// Who has left a group is edited in "Contacts" from now on. False: there is no such person any more.
+bool CardWriter::goToContacts(const Member& departed) {
+    const auto own = _memory.of(kContactsBook, departed.uid);
+    if (!own) return false;
+    _c.book = *_library.book(std::string(kContactsBook));
+    _c.name = own->name;
+    _c.judged = own;
+    return true;
 }
 
 void CardWriter::noteTakenOut() {
@@ -204,13 +215,20 @@ Written CardWriter::put(const std::string& text) {
     if (!Devices(_memory).mayLearn(_c.device, knowledgeOf(card)))
         throw Refused(403, kCardSpace, "valid-address-data", "This device has written too many kinds of properties.");
     const Turn turn(bookMemoryPath(_rolvane.path()) + ".lock");
+    bool isElsewhere = false; // the card's person has left the book
     for (int round = 0; round < kRounds; ++round) {
         const auto now = settle();
-        if (!now && !_c.conditions.isAbsent) refuseToBringBack(card);
+        if (const auto left = now || _c.conditions.isAbsent ? std::nullopt : toBeBroughtBack(card)) {
+            if (!_c.repeatsRefused) throw Refused(412, "Somebody else has taken the card out of the book meanwhile.");
+            // The program would never look into the book again. So its next look tells it.
+            isElsewhere = true;
+            if (!goToContacts(*left)) return {};
+            continue;
+        }
         const auto written = card.entity.isGroup ? putGroup(card, now) : putPerson(card, now);
         if (!written) continue;
         Devices(_memory).noteKnowledge(_c.device, knowledgeOf(card));
-        return *written;
+        return isElsewhere ? Written{} : *written;
     }
     throw savedAgainAndAgain();
 }

@@ -31,6 +31,8 @@ struct WriteContext {
     std::string device;
     Conditions conditions;
     std::optional<Member> judged; // what they were judged against
+    // The program sends what was refused again, and again, before it asks for anything else.
+    bool repeatsRefused = false;
 };
 
 struct Written {
@@ -57,7 +59,8 @@ private:
     class Turn; // of a writer
     std::optional<Member> settle();
     void requireWritable(const Book& book) const;
-    void refuseToBringBack(const ClientCard& card);
+    std::optional<Member> toBeBroughtBack(const ClientCard& card);
+    bool goToContacts(const Member& departed);
     void noteTakenOut();
     std::vector<CXExpected> expectedOfBook();
     static std::vector<UniqueId> spellingsOf(const std::string& uid, std::string_view table);

@@ -126,11 +126,7 @@ private:
     }
 
     // Thunderbird begins anew after 400 alone. After 403 it would ask with the same token for ever.
-    int refusalOfToken() const {
-        const char* program = apr_table_get(_resource.r->headers_in, "User-Agent");
-        return program && std::string_view(program).find("Thunderbird/") != std::string_view::npos ? HTTP_BAD_REQUEST
-                                                                                                   : HTTP_FORBIDDEN;
-    }
+    int refusalOfToken() const { return isThunderbird(_resource.r) ? HTTP_BAD_REQUEST : HTTP_FORBIDDEN; }
 
     template <class Call>
     void forEachPage(int64_t from, bool withGone, Call call) {

@@ -133,6 +133,11 @@ bool isOurs(const dav_resource* resource) {
     return resource->hooks == &kRepository;
 }
 
+bool isThunderbird(const request_rec* r) {
+    const char* program = apr_table_get(r->headers_in, "User-Agent");
+    return program && std::string_view(program).find("Thunderbird/") != std::string_view::npos;
+}
+
 dav_error* errorOf(apr_pool_t* pool, const Refused& refused) {
     const char* words = apr_pstrdup(pool, refused.words().c_str());
     if (refused.precondition().empty()) return dav_new_error(pool, refused.status(), 0, 0, words);

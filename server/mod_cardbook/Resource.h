@@ -35,6 +35,9 @@ dav_resource* newResource(apr_pool_t* pool, Resource resource);
 Resource& of(const dav_resource* resource);
 bool isOurs(const dav_resource* resource);
 
+// Does the request say that it is Thunderbird's? Some refusals it does not get over.
+bool isThunderbird(const request_rec* r);
+
 // An error as mod_dav sends it. Never null.
 dav_error* errorOf(apr_pool_t* pool, const Refused& refused);
 

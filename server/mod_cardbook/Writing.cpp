@@ -42,7 +42,8 @@ Conditions conditionsOf(const request_rec* r) {
 CardWriter writerOf(const Resource& it) {
     if (it.place.kind != Place::Kind::card) throw onlyCards();
     if (!it.book) throw Refused(HTTP_NOT_FOUND, "There is no such book.");
-    return {*it.library, WriteContext{*it.book, it.place.name, it.base, it.r->user, conditionsOf(it.r), it.member}};
+    return {*it.library, WriteContext{*it.book, it.place.name, it.base, it.r->user, conditionsOf(it.r), it.member,
+                                      isThunderbird(it.r)}};
 }
 
 } // namespace

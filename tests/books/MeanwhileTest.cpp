@@ -138,6 +138,32 @@ TEST_F(Meanwhile, SomebodyElseTakesAPersonAwayAndAnEditOfTheCardBringsNobodyBack
     EXPECT_EQ(peopleOf(""), 2u);
 }
 
+// Thunderbird sends what was refused before all else, and would never look into the book again.
+TEST_F(Meanwhile, SomebodyElseTakesAPersonAwayAndThunderbirdIsToldByItsNextLook) {
+    const BooksWorld::Headers thunderbird = {{"User-Agent", "Mozilla/5.0 Gecko/20100101 Thunderbird/153.0"}};
+    const auto ann = world.addPerson("Ann", "Lee");
+    const auto group = world.addGroup("Friends", {ann});
+    const std::string name = BooksWorld::uuidOf(ann) + ".vcf", uid = "urn:uuid:" + BooksWorld::uuidOf(ann);
+    for (const std::string& book : {bookOf(group), std::string(kContacts)}) {
+        ASSERT_EQ(world.sync(book, "").status, 207);
+        ASSERT_EQ(world.multiget(book, {book + name}).status, 207);
+    }
+    group->removeMember(ann);
+    world.rolvane().save();
+    const auto edit = world.put(bookOf(group) + name, cardOf(uid, "Ann", "Leigh"), thunderbird);
+    EXPECT_EQ(edit.status, 201) << edit.body;
+    EXPECT_EQ(edit.tag(), "");
+    EXPECT_EQ(group->memberCount(), 0u);
+    EXPECT_EQ(ann->valueForProperty(kCXLastNameProperty).string(), "Leigh") << "the edit itself is kept";
+    EXPECT_EQ(world.ask("GET", bookOf(group) + name).status, 404);
+    ASSERT_EQ(world.multiget(kContacts, {kContacts + name}).status, 207);
+    world.rolvane().removeRecord(ann);
+    world.rolvane().save();
+    EXPECT_EQ(world.put(kContacts + name, cardOf(uid, "Ann", "Lye"), thunderbird).status, 201);
+    EXPECT_EQ(peopleOf(""), 0u);
+    EXPECT_EQ(world.put(kContacts + name, cardOf(uid, "Ann", "Lye")).status, 412) << "other programs get over it";
+}
+
 TEST_F(Meanwhile, APersonWhoWasTakenAwayIsWrittenByADeviceThatNeverHadTheCard) {
     const auto ann = world.addPerson("Ann", "Lee");
     const std::string path = kContacts + BooksWorld::uuidOf(ann) + ".vcf";
