@@ -19,6 +19,7 @@
 #include "daemon/Leftovers.h"
 #include "daemon/NewsWatch.h"
 #include "daemon/OwnPasses.h"
+#include "daemon/PassCounters.h"
 #include "daemon/StoreNewsRequest.h"
 #include "daemon/TerminationWatch.h"
 #include "daemon/TreesAhead.h"
@@ -166,6 +167,7 @@ private:
             [&store] { releaseLocksOfEndedRuns(store); }, [&store] { return takeFailures(store); },
             [this, &store](const PassOutcome& outcome) {
                 _basesRead = basesOf(outcome, store.account());
+                _counters.passEnded(outcome);
                 if (_ownPasses) _ownPasses->passEnded(resultOf(outcome));
                 if (_news) _news->passEnded(resultOf(outcome), treesOf(outcome));
             }});
@@ -329,6 +331,7 @@ private:
     std::optional<NewsWatch> _news;        // as _ownPasses
     std::optional<TreesAhead> _treesAhead; // as _ownPasses
     std::vector<Url> _basesRead;           // of the trees that the last pass was about
+    PassCounters _counters{PassCounters::defaultPath(), Clock::system().now()};
     std::mt19937 _random{std::random_device()()};
     std::optional<SleepWatch> _sleep;
     RunLoop::Handle _terminated;

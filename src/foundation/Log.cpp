@@ -1,5 +1,6 @@
 #include "foundation/Log.h"
 
+#include "foundation/LogEvents.h"
 #include "foundation/LogSinks.h"
 
 #include <atomic>
@@ -112,6 +113,10 @@ std::shared_ptr<LogSink> LogSink::current() {
     return sinks().platform;
 }
 
+void LogSink::writeEvent(const LogEvent& event) {
+    write(event.line);
+}
+
 int debugLevel() {
     return theDebugLevel.load(std::memory_order_relaxed);
 }
@@ -143,8 +148,12 @@ std::string formatLog(std::string_view format, const std::vector<LogArgument>& a
     return out;
 }
 
-void writeLog(std::string_view line) {
-    LogSink::current()->write(line);
+void writeLog(std::string_view format, const std::vector<LogArgument>& arguments) {
+    LogSink::current()->writeEvent(logEvent(format, arguments));
+}
+
+void writeProgress(std::string line) {
+    LogSink::current()->writeEvent(progressEvent(std::move(line)));
 }
 
 } // namespace detail

@@ -10,6 +10,8 @@
 
 namespace rolvane {
 
+struct LogEvent;
+
 // Where log lines go: the journal (structured fields), or standard error where there is no journal or standard error
 // is a terminal or $ROLVANE_LOG is "stderr" (chosen at the first line of the process). Exists so that tests can
 // replace it. Called from any thread; must not throw.
@@ -17,6 +19,7 @@ class LogSink {
 public:
     virtual ~LogSink() = default;
     virtual void write(std::string_view line) = 0;
+    virtual void writeEvent(const LogEvent& event); // as a line, where nothing else is known of events
 
     // Installs a sink for the process and gives back the former one; none restores the platform's sink.
     static std::shared_ptr<LogSink> install(std::shared_ptr<LogSink> sink);
@@ -92,7 +95,8 @@ LogArgument logArgument(const T& value) {
 // Placeholders may carry the printf flags '-' and '0', a width, and a precision (digits after the point of "%f",
 // longest text of "%s"). A placeholder without an argument stays as it is written; surplus arguments are not shown.
 std::string formatLog(std::string_view format, const std::vector<LogArgument>& arguments);
-void writeLog(std::string_view line);
+void writeLog(std::string_view format, const std::vector<LogArgument>& arguments);
+void writeProgress(std::string line);
 
 } // namespace detail
 
@@ -105,13 +109,13 @@ std::string CXFormat(std::string_view format, const Args&... args) {
 // The system log, whatever the debug level.
 template <class... Args>
 void CXLog(std::string_view format, const Args&... args) {
-    detail::writeLog(CXFormat(format, args...));
+    detail::writeLog(format, {detail::logArgument(args)...});
 }
 
 // The daemon's diagnostic log: nothing at all, not even formatting, at debug level 0.
 template <class... Args>
 void CXDLog(std::string_view format, const Args&... args) {
-    if (debugLevel() != 0) CXLog(format, args...);
+    if (debugLevel() != 0) detail::writeProgress(CXFormat(format, args...));
 }
 
 } // namespace rolvane

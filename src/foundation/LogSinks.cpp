@@ -17,8 +17,6 @@ namespace rolvane {
 
 namespace {
 
-constexpr int kPriorityNotice = 5;
-
 void writeFully(int fd, std::string_view bytes) {
     while (!bytes.empty()) {
         ssize_t n = ::write(fd, bytes.data(), bytes.size());
@@ -36,9 +34,15 @@ LogDestination chooseLogDestination(std::string_view request, bool journalSocket
     return standardErrorIsTerminal ? LogDestination::standardError : LogDestination::journal;
 }
 
-std::vector<std::string> journalFields(std::string_view line, std::string_view identifier) {
-    return {fmt::format("MESSAGE={}", line), fmt::format("PRIORITY={}", kPriorityNotice),
-            fmt::format("SYSLOG_IDENTIFIER={}", identifier), fmt::format("TID={}", ::syscall(SYS_gettid))};
+std::vector<std::string> journalFields(const LogEvent& event, std::string_view identifier, bool withNames) {
+    std::vector<std::string> fields{fmt::format("MESSAGE={}", withNames ? event.line : event.publicLine),
+                                    fmt::format("MESSAGE_ID={}", event.kind->messageId),
+                                    fmt::format("PRIORITY={}", event.kind->priority),
+                                    fmt::format("SYSLOG_IDENTIFIER={}", identifier),
+                                    fmt::format("TID={}", ::syscall(SYS_gettid)),
+                                    fmt::format("ROLVANE_EVENT={}", event.kind->name)};
+    if (!event.format.empty()) fields.push_back("ROLVANE_FORMAT=" + event.format);
+    return fields;
 }
 
 std::string standardErrorLine(std::string_view line, std::string_view identifier) {
@@ -57,11 +61,15 @@ std::string standardErrorLine(std::string_view line, std::string_view identifier
 }
 
 void JournalSink::write(std::string_view line) {
-    auto fields = journalFields(line, program_invocation_short_name);
+    writeEvent(logEvent("%@", {{std::string(line)}}));
+}
+
+void JournalSink::writeEvent(const LogEvent& event) {
+    auto fields = journalFields(event, program_invocation_short_name, debugLevel() != 0);
     std::vector<iovec> vectors;
     for (auto& field : fields) vectors.push_back({field.data(), field.size()});
     if (sd_journal_sendv(vectors.data(), static_cast<int>(vectors.size())) < 0)
-        writeFully(STDERR_FILENO, standardErrorLine(line, program_invocation_short_name));
+        writeFully(STDERR_FILENO, standardErrorLine(event.line, program_invocation_short_name));
 }
 
 void StandardErrorSink::write(std::string_view line) {

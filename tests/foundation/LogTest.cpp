@@ -7,6 +7,7 @@
 #include "support/TempHome.h"
 
 #include <cerrno>
+#include <functional>
 #include <memory>
 #include <optional>
 #include <regex>
@@ -144,19 +145,48 @@ TEST(LogDestination, TheJournalIsUsedWhereThereIsOneUnlessSomebodyIsWatching) {
     EXPECT_EQ(chooseLogDestination("journal", false, true), LogDestination::standardError);
 }
 
-TEST(LogSinks, AJournalEntryNamesMessagePriorityProgramAndThread) {
-    auto fields = journalFields("two\nlines", "RolvaneManager");
-    ASSERT_EQ(fields.size(), 4u);
-    EXPECT_EQ(fields[0], "MESSAGE=two\nlines");
-    EXPECT_EQ(fields[1], "PRIORITY=5");
-    EXPECT_EQ(fields[2], "SYSLOG_IDENTIFIER=RolvaneManager");
-    EXPECT_EQ(fields[3], "TID=" + std::to_string(::gettid()));
+TEST(LogSinks, AJournalEntryNamesMessageKindPriorityProgramAndThread) {
+    const LogEvent event = logEvent("A lock could not be renewed: %@", {{"two\nlines"}});
+    EXPECT_EQ(journalFields(event, "RolvaneManager", true),
+              (std::vector<std::string>{"MESSAGE=A lock could not be renewed: two\nlines",
+                                        std::string("MESSAGE_ID=") + event.kind->messageId, "PRIORITY=5",
+                                        "SYSLOG_IDENTIFIER=RolvaneManager", "TID=" + std::to_string(::gettid()),
+                                        "ROLVANE_EVENT=lock", "ROLVANE_FORMAT=A lock could not be renewed: %@"}));
 }
 
-TEST(LogSinks, TheJournalGetsTheFieldsOfALine) {
+// What is sent to the journal for a line, joined.
+std::string journalledFor(int level, const std::function<void()>& log) {
+    const int former = debugLevel();
+    setDebugLevel(level);
+    const auto sink = LogSink::install(std::make_shared<JournalSink>());
     journalAnswer = 0;
-    JournalSink().write("Entering main run loop.");
-    EXPECT_EQ(journalled, journalFields("Entering main run loop.", program_invocation_short_name));
+    journalled.clear();
+    log();
+    LogSink::install(sink);
+    setDebugLevel(former);
+    std::string all;
+    for (const std::string& field : journalled) all += field + "\n";
+    return all;
+}
+
+TEST(LogSinks, TheJournalHearsNoNamesAtTheDefaultLevelAndAllOfThemWhenSomebodyLooks) {
+    const auto log = [] { CXLog("The tree of %@ %@. %@", std::string("zoe"), "has no list", "It is left alone."); };
+    EXPECT_NE(journalledFor(0, log).find("MESSAGE=The tree of … has no list. It is left alone.\n"), std::string::npos)
+        << journalledFor(0, log);
+    EXPECT_NE(journalledFor(1, log).find("MESSAGE=The tree of zoe has no list. It is left alone.\n"),
+              std::string::npos);
+    const auto unknown = [] { CXLog("Nobody has listed this: %@, %@", std::string("zoe"), 7); };
+    EXPECT_EQ(journalledFor(0, unknown).find("zoe"), std::string::npos);
+    const auto progress = [] { CXDLog("Entering main run loop."); };
+    EXPECT_EQ(journalledFor(0, progress), "");
+    EXPECT_NE(journalledFor(1, progress).find("PRIORITY=7\n"), std::string::npos);
+    EXPECT_NE(journalledFor(1, progress).find("ROLVANE_EVENT=progress\n"), std::string::npos);
+}
+
+TEST(LogSinks, TheJournalGetsALineThatNothingIsKnownOf) {
+    EXPECT_NE(journalledFor(0, [] { JournalSink().write("Entering main run loop."); })
+                  .find("MESSAGE=Entering main run loop.\n"),
+              std::string::npos);
 }
 
 TEST(LogSinks, ALineThatTheJournalRefusesGoesToStandardError) {

@@ -22,7 +22,7 @@ void note(EngineParts& parts, const Value& damage) {
 }
 
 void tell(EngineParts& parts, const std::string& damage) {
-    CXLog("%@", damage);
+    CXLog("The contact database is damaged: %@", damage);
     parts.outcomes.caught(damage);
     note(parts, damage);
 }
