@@ -40,7 +40,9 @@ void whileDaemonRests(const std::function<void()>& action) {
 }
 
 CommandError notRemoved(const LeftOnStore::Failure& failure, const std::string& message) {
-    return CommandError(failure.code == 0 ? kUnreachable : kFailed, message);
+    constexpr int kUnauthorized = 401, kForbidden = 403;
+    const bool isRefused = failure.code == kUnauthorized || failure.code == kForbidden;
+    return {failure.code == 0 ? kUnreachable : isRefused ? kRefused : kFailed, message};
 }
 
 // Files that nothing else knows of are not to stay among what is published now.

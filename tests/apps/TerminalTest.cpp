@@ -97,8 +97,9 @@ TEST_F(Terminals, AndPipesHaveTheSameExitCodesAndNoColours) {
         const Ran plain = inAPipe("C", command), german = inAPipe("de_DE.UTF-8", command);
         EXPECT_EQ(plain.status, status) << command << "\n" << plain;
         EXPECT_EQ(german.status, status) << command << "\n" << german;
-        EXPECT_EQ(plain.output, german.output) << command;
-        EXPECT_EQ((plain.output + plain.errors).find('\x1B'), std::string::npos) << command;
+        EXPECT_EQ(plain.output.empty(), german.output.empty()) << command;
+        EXPECT_EQ((plain.output + plain.errors + german.output + german.errors).find('\x1B'), std::string::npos)
+            << command;
         for (const unsigned short columns : {40, 80, 200}) {
             const Shown shown = at(columns, "de_DE.UTF-8", command);
             EXPECT_EQ(shown.status, status) << command << " at " << columns << " columns\n" << shown.text;
