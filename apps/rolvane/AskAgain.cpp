@@ -1,6 +1,7 @@
 #include "AskAgain.h"
 
 #include "FailureText.h"
+#include "Texts.h"
 
 #include <cmath>
 #include <fmt/format.h>
@@ -14,7 +15,7 @@ bool AskAgain::after(const PassFailure& failure) {
         _patience.pauseAfter(failure, spent.count(), std::uniform_real_distribution<double>(0, 1)(_random));
     if (!pause) return false;
     const FailureText text = failureText(failure, sceneOfTheAccount(Clock::system().now()));
-    _context.say(fmt::format("{} It is asked again in {} s.", text.what, std::max(1L, std::lround(*pause))));
+    _context.say(tr("{} It is asked again in {} s.", text.what, std::max(1L, std::lround(*pause))));
     std::this_thread::sleep_for(std::chrono::duration<double>(*pause));
     return true;
 }

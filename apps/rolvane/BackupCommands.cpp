@@ -5,6 +5,7 @@
 #include "Consent.h"
 #include "Counted.h"
 #include "Subscriptions.h"
+#include "Texts.h"
 #include "ValueNames.h"
 
 #include "daemon/DaemonControl.h"
@@ -116,7 +117,7 @@ void restore(Context& context, const Options& options) {
     Backup backup(options.file);
     const BackupFacts& facts = backup.facts();
     const std::string here = whatIsHere(), held = contentsText(facts);
-    const std::string made = fmt::format("of {}{}", facts.date.toISO8601(),
+    const std::string made = fmt::format("of {}{}", shownDate(facts.date),
                                          facts.computer.empty() ? "" : " from the computer " + facts.computer);
     if (options.dryRun) {
         if (context.json) {

@@ -2,6 +2,7 @@
 #include "BooksAutostart.h"
 #include "Counted.h"
 #include "QrCode.h"
+#include "Texts.h"
 #include "ValueNames.h"
 
 #include "foundation/Date.h"
@@ -36,7 +37,7 @@ Json devicesJson(const BooksDevices& devices) {
 }
 
 std::string lastUseText(const Json& device) {
-    return device["lastUse"].is_null() ? "never used" : "last used " + device["lastUse"].get<std::string>();
+    return device["lastUse"].is_null() ? "never used" : "last used " + shownDate(device["lastUse"].get<std::string>());
 }
 
 Json serverJson(const BooksServer& server, const BooksOptions& options) {

@@ -1,6 +1,7 @@
 #include "Conflicts.h"
 #include "Context.h"
 #include "RecordJson.h"
+#include "Texts.h"
 #include "ValueNames.h"
 
 #include "contacts/records/Constants.h"
@@ -96,7 +97,7 @@ std::string conflictText(const Json& conflict) {
     return fmt::format("{} of {}: {} was kept, {} {} gave way, on {}", conflict["property"].get<std::string>(),
                        conflict["name"].get<std::string>(), conflict["keptText"].get<std::string>(),
                        conflict["own"].get<bool>() ? "your" : "the other", conflict["lostText"].get<std::string>(),
-                       conflict["date"].get<std::string>());
+                       shownDate(conflict["date"].get<std::string>()));
 }
 
 void addConflictCommands(CLI::App& app, Context& context) {

@@ -1,6 +1,7 @@
 #include "Consent.h"
 
 #include "Questions.h"
+#include "Texts.h"
 
 #include <fmt/format.h>
 
@@ -14,10 +15,9 @@ void requireConsent(Context& context, bool yes, const std::string& question, con
     if (yes) return;
     Questions questions(context, true);
     if (!questions.mayAsk())
-        throw CommandError(kRefused,
-                           fmt::format("\"{}\" cannot be asked: there is no terminal. {} Give --yes where the "
-                                       "answer is yes.",
-                                       question, unchanged));
+        throw CommandError(kRefused, tr("\"{}\" cannot be asked: there is no terminal. {} Give --yes where the "
+                                        "answer is yes.",
+                                        question, unchanged));
     if (!questions.yes(question, false)) throw CommandError(kRefused, unchanged);
 }
 

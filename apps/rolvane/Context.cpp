@@ -4,6 +4,7 @@
 #include "ProgressLine.h"
 #include "SafeText.h"
 #include "Terminal.h"
+#include "Texts.h"
 
 #include "contacts/database/DaemonMemory.h"
 #include "contacts/database/DamagedDatabase.h"
@@ -119,7 +120,7 @@ std::string pathOf(const CLI::App& command) {
 
 CLI::App* addCommand(CLI::App& parent, Context& context, const std::string& name, const std::string& description,
                      const std::function<void(CLI::App&)>& declare, std::function<void()> body) {
-    CLI::App* command = parent.add_subcommand(name, description);
+    CLI::App* command = parent.add_subcommand(name, translated(description.c_str()));
     command->fallthrough();
     command->footer(helpFooter(pathOf(*command)));
     command->add_flag("--json", context.json, "Print data as one JSON document");

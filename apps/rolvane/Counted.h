@@ -1,15 +1,15 @@
 #pragma once
 
-#include <fmt/format.h>
+#include "Texts.h"
+
 #include <string>
-#include <string_view>
 
 namespace rolvane::cli {
 
-// "1 person", "2 people".
+// "1 person", "2 people": within sentences that are English everywhere. countedText stands in translated ones.
 template <class Number>
-std::string counted(Number count, std::string_view one, std::string_view more) {
-    return fmt::format("{} {}", count, count == 1 ? one : more);
+std::string counted(Number count, const char* one, const char* more) {
+    return shownNumber(static_cast<unsigned long long>(count)) + " " + (count == 1 ? one : more);
 }
 
 } // namespace rolvane::cli

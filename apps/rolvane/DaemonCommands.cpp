@@ -6,8 +6,10 @@
 #include "LeftOnStore.h"
 #include "PassReport.h"
 #include "PassWatch.h"
+#include "SafeText.h"
 #include "Publication.h"
 #include "Subscriptions.h"
+#include "Texts.h"
 #include "Withdrawn.h"
 
 #include "conduits/store/EndedPublication.h"
@@ -34,12 +36,13 @@ using Json = nlohmann::ordered_json;
 void daemonStart(Context& context) {
     const DaemonControl daemon;
     const bool started = daemon.start();
-    context.say(started ? "RolvaneManager is at work."
-                        : fmt::format("RolvaneManager runs already (process {}).", daemon.running().value_or(0)));
+    context.say(started ? translated("RolvaneManager is at work.")
+                        : tr("RolvaneManager runs already (process {}).", daemon.running().value_or(0)));
 }
 
 void daemonStop(Context& context) {
-    context.say(DaemonControl().stop() ? "RolvaneManager has ended." : "RolvaneManager was not running.");
+    context.say(DaemonControl().stop() ? translated("RolvaneManager has ended.")
+                                       : translated("RolvaneManager was not running."));
 }
 
 // Exit code 0 when it runs, 3 when it does not.
@@ -48,7 +51,8 @@ void daemonStatus(Context& context) {
     if (context.json)
         context.print({{"running", pid.has_value()}, {"process", pid ? Json(*pid) : Json()}});
     else
-        context.line(pid ? fmt::format("RolvaneManager runs (process {}).", *pid) : "RolvaneManager is not running.");
+        context.line(pid ? tr("RolvaneManager runs (process {}).", *pid)
+                         : translated("RolvaneManager is not running."));
     if (!pid) context.exitCode = kNotFound;
 }
 
@@ -111,32 +115,31 @@ std::string refusalReason(const Json& record) {
     const std::string user = record["user"];
     if (record["why"] == kRefusedAsGroupIsGone) {
         const std::string group = record["group"].is_null()
-                                      ? "the group"
-                                      : fmt::format("the group \"{}\"", record["group"].get<std::string>());
-        return fmt::format("{} has deleted {} meanwhile, so what you changed in it was given up. Make another group "
-                           "to keep its people together.",
-                           user == kSelf.str() ? "somebody else who may write" : user, group);
+                                      ? std::string(translated("the group"))
+                                      : tr("the group \"{}\"", record["group"].get<std::string>());
+        return tr("{} has deleted {} meanwhile, so what you changed in it was given up. Make another group "
+                  "to keep its people together.",
+                  user == kSelf.str() ? translated("somebody else who may write") : user, group);
     }
     if (record["why"] == kRefusedForItsName)
-        return "the store keeps files of its own under that identifier. The change stays in this database.";
+        return translated("the store keeps files of its own under that identifier. The change stays in this database.");
     if (record["why"] == kRefusedByOwnStore)
-        return "the store does not let you write in your own tree. Nothing of it is lost here, and it is sent again "
-               "until "
-               "the store takes it. Ask the store's administrator to let you write there.";
+        return translated("the store does not let you write in your own tree. Nothing of it is lost here, and it is "
+                          "sent again until the store takes it. Ask the store's administrator to let you write there.");
     const std::string advice =
         user == kSelf.str()
-            ? "Have the store's administrator let you write in your tree, then edit again."
-            : fmt::format("Ask {} for `rolvane share {} --write`, then edit again.", user, CXDAVManager::vaultraUser());
-    return "the store does not let you write there. " + advice;
+            ? std::string(translated("Have the store's administrator let you write in your tree, then edit again."))
+            : tr("Ask {} for `rolvane share {} --write`, then edit again.", user, CXDAVManager::vaultraUser());
+    return tr("the store does not let you write there. {}", advice);
 }
 
 std::string refusedText(const Json& record) {
     const int64_t changes = record["changes"];
     const std::string user = record["user"];
-    return fmt::format("{} of {} contacts, on {}: {}", counted(changes, "change", "changes"),
-                       user == kSelf.str() ? "your own" : user + "'s",
-                       record["date"].is_null() ? "an unknown date" : record["date"].get<std::string>(),
-                       refusalReason(record));
+    return tr("{}, {}, on {}: {}", user == kSelf.str() ? translated("your own contacts") : tr("{}'s contacts", user),
+              countedText(changes, "change", "changes"),
+              record["date"].is_null() ? translated("an unknown date") : shownDate(record["date"].get<std::string>()),
+              refusalReason(record));
 }
 
 // Of no interest once something is published again.
@@ -153,14 +156,15 @@ Json endedJson(const Preferences& preferences, bool publishes) {
 std::string endedText(const Json& ended) {
     std::string users;
     for (const Json& user : ended["mayStillRead"]) users += (users.empty() ? "" : ", ") + user.get<std::string>();
-    return fmt::format("on {}: {}. `rolvane publish` publishes again.{}", ended["date"].get<std::string>(),
-                       ended["why"] == "replaced"
-                           ? "another publication of yours lies in its place on the store, made from another "
-                             "computer perhaps"
-                           : "the store has nothing of it any more, or does not let you in",
-                       users.empty() ? ""
-                                     : " The store does not know yet that you took rights away from " + users +
-                                           ": after `rolvane publish`, `rolvane unshare` takes them away there.");
+    return tr("on {}: {}. `rolvane publish` publishes again.{}", shownDate(ended["date"].get<std::string>()),
+              ended["why"] == "replaced"
+                  ? translated("another publication of yours lies in its place on the store, made from another "
+                               "computer perhaps")
+                  : translated("the store has nothing of it any more, or does not let you in"),
+              users.empty() ? ""
+                            : tr(" The store does not know yet that you took rights away from {}: after `rolvane "
+                                 "publish`, `rolvane unshare` takes them away there.",
+                                 users));
 }
 
 Json status(Context& context) {
@@ -203,20 +207,24 @@ Json status(Context& context) {
 }
 
 std::string publishedText(const Json& published) {
-    if (published["everything"].get<bool>()) return "the whole contact list";
-    if (published["groups"].empty()) return "nothing";
+    if (published["everything"].get<bool>()) return translated("the whole contact list");
+    if (published["groups"].empty()) return translated("nothing");
     std::string names;
     for (const Json& group : published["groups"])
         names += (names.empty() ? "" : ", ") + group["name"].get<std::string>();
-    return (published["groups"].size() == 1 ? "the group " : "the groups ") + names;
+    return published["groups"].size() == 1 ? tr("the group {}", names) : tr("the groups {}", names);
 }
 
 std::string subscribedText(const Json& subscriptions) {
     std::string text;
     for (const Json& s : subscriptions)
-        text += (text.empty() ? "to " : ", ") + s["user"].get<std::string>() +
-                (s["writable"].get<bool>() ? " (read and write)" : "");
-    return text.empty() ? "to nobody" : text;
+        text += (text.empty() ? "" : ", ") + s["user"].get<std::string>() +
+                (s["writable"].get<bool>() ? translated(" (read and write)") : "");
+    return text.empty() ? translated("to nobody") : tr("to {}", text);
+}
+
+std::string inStep(bool own, const std::string& when) {
+    return own ? tr("sent {}", when) : tr("read {}", when);
 }
 
 // When the tree was last as it should be, and since when it is not.
@@ -224,12 +232,12 @@ std::string inStepText(const Json& tree) {
     const bool own = tree["own"];
     const Json& direction = tree[own ? "out" : "in"];
     const auto date = [&](const char* key) {
-        return direction[key].is_null() ? "" : direction[key].get<std::string>();
+        return direction[key].is_null() ? std::string() : shownDate(direction[key].get<std::string>());
     };
     const std::string last = date("inStep"), since = date("waitingSince");
-    return fmt::format("{}: {}{}{}", own ? "your own contacts" : tree["user"].get<std::string>() + "'s contacts",
-                       own ? "sent " : "read ", last.empty() ? "never" : last,
-                       since.empty() ? "" : ", what came after that waits since " + since);
+    return (own ? translated("your own contacts") : tr("{}'s contacts", tree["user"].get<std::string>())) + ": " +
+           inStep(own, last.empty() ? translated("never") : last) +
+           (since.empty() ? "" : tr(", what came after that waits since {}", since));
 }
 
 void showStatus(Context& context) {
@@ -237,43 +245,47 @@ void showStatus(Context& context) {
     if (!s["damaged"].is_null()) context.exitCode = kFailed;
     if (context.json) return context.print(s);
     const auto row = [&](const std::string& label, const std::string& text) {
-        context.line(fmt::format("{:<15}{}", label, text));
+        constexpr size_t kColumn = 15;
+        context.line(label + std::string(kColumn - std::min(kColumn - 1, columnsOf(label)), ' ') + text);
     };
     const size_t people = s["people"], groups = s["groups"], pending = s["pending"];
-    row("Contacts", counted(people, "person", "people") + ", " + counted(groups, "group", "groups"));
-    if (!s["damaged"].is_null()) row("Database", s["damaged"].get<std::string>());
-    row("Daemon", s["daemon"].is_null() ? "not running (`rolvane daemon start`)"
-                                        : fmt::format("running, process {}", s["daemon"].get<int>()));
+    row(translated("Contacts"),
+        countedText(people, "person", "people") + ", " + countedText(groups, "group", "groups"));
+    if (!s["damaged"].is_null()) row(translated("Database"), s["damaged"].get<std::string>());
+    row(translated("Daemon"), s["daemon"].is_null() ? translated("not running (`rolvane daemon start`)")
+                                                    : tr("running, process {}", s["daemon"].get<int>()));
     if (s["store"].is_null()) {
-        row("Store", "no account yet (`rolvane account set`)");
+        row(translated("Store"), translated("no account yet (`rolvane account set`)"));
     } else {
         const Json& store = s["store"];
-        row("Store", fmt::format("{} at {}", store["user"].get<std::string>(), store["endpoint"].get<std::string>()));
-        row("", store["reachable"].get<bool>() ? "can be reached" : store["reason"].get<std::string>());
+        row(translated("Store"),
+            tr("{} at {}", store["user"].get<std::string>(), store["endpoint"].get<std::string>()));
+        row("", store["reachable"].get<bool>() ? translated("can be reached") : store["reason"].get<std::string>());
         if (!store["reachable"].get<bool>()) row("", store["toDo"].get<std::string>());
     }
-    row("Published", publishedText(s["published"]));
-    if (!s["publicationEnded"].is_null()) row("", "ended " + endedText(s["publicationEnded"]));
+    row(translated("Published"), publishedText(s["published"]));
+    if (!s["publicationEnded"].is_null()) row("", tr("ended {}", endedText(s["publicationEnded"])));
     if (s["leftOnStore"])
-        row("", "files of what was withdrawn are still on the store; the same `rolvane unpublish` again removes them");
-    row("Subscribed", subscribedText(s["subscriptions"]));
+        row("", translated("files of what was withdrawn are still on the store; the same `rolvane unpublish` again "
+                           "removes them"));
+    row(translated("Subscribed"), subscribedText(s["subscriptions"]));
     if (!s["books"].is_null()) {
-        row("Address books", booksText(s["books"]));
-        for (const Json& link : s["books"]["links"]) row("Linked", linkText(link));
+        row(translated("Address books"), booksText(s["books"]));
+        for (const Json& link : s["books"]["links"]) row(translated("Linked"), linkText(link));
     }
-    for (const Json& record : s["withdrawn"]) row("Withdrawn", withdrawnText(record));
-    for (const Json& record : s["refused"]) row("Refused", refusedText(record));
+    for (const Json& record : s["withdrawn"]) row(translated("Withdrawn"), withdrawnText(record));
+    for (const Json& record : s["refused"]) row(translated("Refused"), refusedText(record));
     for (const Json& conflict : s["conflicts"])
-        row("Conflict", fmt::format("{}; `rolvane conflicts restore {}` puts it back", conflictText(conflict),
-                                    conflict["number"].get<int64_t>()));
-    row("Waiting", counted(pending, "change", "changes"));
+        row(translated("Conflict"), tr("{}; `rolvane conflicts restore {}` puts it back", conflictText(conflict),
+                                       conflict["number"].get<int64_t>()));
+    row(translated("Waiting"), countedText(pending, "change", "changes"));
     if (const size_t edited = s["notLookedAt"]; edited > 0)
-        row("", fmt::format("{} edited since the daemon looked last{}", counted(edited, "record was", "records were"),
-                            s["daemon"].is_null() ? "; it is not running" : ""));
-    if (s["pass"].is_null()) return row("Last pass", "never");
-    std::string label = "In step";
+        row("", tr("{} edited since the daemon looked last{}", countedText(edited, "record was", "records were"),
+                   s["daemon"].is_null() ? translated("; it is not running") : ""));
+    if (s["pass"].is_null()) return row(translated("Last pass"), translated("never"));
+    std::string label = translated("In step");
     for (const Json& tree : s["pass"]["trees"]) row(std::exchange(label, ""), inStepText(tree));
-    row("Last pass", s["lastPass"].get<std::string>());
+    row(translated("Last pass"), shownDate(s["lastPass"].get<std::string>()));
     for (const Json& message : s["pass"]["messages"]) row("", message.get<std::string>());
 }
 
@@ -310,14 +322,17 @@ void tellEnd(Context& context, const PassOutcome& outcome) {
     if (context.json) return context.line(Json{{"event", "ended"}, {"pass", outcomeJson(outcome)}}.dump());
     const PassReport told = reportOf(outcome, !outcome.full);
     for (const std::string& line : told.lines) context.line(line);
-    if (told.lines.empty()) context.line(outcome.full ? "Everything is up to date." : "Everything is on the store.");
+    if (told.lines.empty())
+        context.line(outcome.full ? translated("Everything is up to date.")
+                                  : translated("Everything is on the store."));
 }
 
 void watch(Context& context, const WatchOptions& options) {
     PassWatch pass(context);
     const bool runs = DaemonControl().running().has_value();
     if (!runs && options.seconds <= 0)
-        context.say("RolvaneManager is not running; it is shown once it does. `rolvane daemon start` starts it.");
+        context.say(
+            translated("RolvaneManager is not running; it is shown once it does. `rolvane daemon start` starts it."));
     Interrupt interrupt(context.loop());
     std::unique_ptr<ProgressBar> bar;
     const bool draw = context.dataIsTerminal() && context.talkIsTerminal() && !context.json;
@@ -337,8 +352,8 @@ void watch(Context& context, const WatchOptions& options) {
             bar->update(event.fraction, event.location);
         } else {
             bar.reset();
-            if (event.kind == Kind::started) context.line("started");
-            if (event.kind == Kind::stopped) context.line("stopped");
+            if (event.kind == Kind::started) context.line(translated("started"));
+            if (event.kind == Kind::stopped) context.line(translated("stopped"));
             if (event.kind == Kind::progress)
                 context.line(fmt::format("{} {:.1f}%", event.location, event.fraction * 100));
         }
@@ -366,10 +381,10 @@ void watch(Context& context, const WatchOptions& options) {
                                        options.seconds > 0 ? options.seconds : kForever);
     if (options.once && outcome) context.exitCode = reportOf(*outcome, !outcome->full).code;
     if (!inTime && options.once)
-        throw CommandError(kUnreachable, fmt::format("No pass ended within {} seconds.{}", options.seconds,
-                                                     runs ? ""
-                                                          : " RolvaneManager is not running; `rolvane daemon "
-                                                            "start` starts it."));
+        throw CommandError(kUnreachable, tr("No pass ended within {} seconds.{}", options.seconds,
+                                            runs ? ""
+                                                 : " RolvaneManager is not running; `rolvane daemon "
+                                                   "start` starts it."));
 }
 
 } // namespace
@@ -381,7 +396,7 @@ void addDaemonCommands(CLI::App& app, Context& context) {
     addCommand(*daemon, context, "stop", "End it; what waits is kept", nullptr, [&context] { daemonStop(context); });
     addCommand(*daemon, context, "restart", "End it if it runs, and start it", nullptr, [&context] {
         DaemonControl().restart();
-        context.say("RolvaneManager is at work.");
+        context.say(translated("RolvaneManager is at work."));
     });
     addCommand(*daemon, context, "status", "Tell whether it runs (exit code 0 or 3)", nullptr,
                [&context] { daemonStatus(context); });

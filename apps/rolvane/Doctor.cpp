@@ -6,6 +6,7 @@
 #include "Publication.h"
 #include "PublishedAlready.h"
 #include "Subscriptions.h"
+#include "Texts.h"
 #include "UnitState.h"
 
 #include "contacts/database/DamagedDatabase.h"
@@ -202,11 +203,11 @@ Finding Doctor::authority() {
     const Json figures{{"certificates", chain.size()}, {"daysLeft", wholeDays(left)}};
     const std::string whose = first.isAuthority ? "The store's authority" : "The store's certificate";
     if (left < 0)
-        return {"authority", State::failed, fmt::format("{} ended on {}.", whose, first.until.toISO8601()),
+        return {"authority", State::failed, fmt::format("{} ended on {}.", whose, shownDate(first.until)),
                 "rolvane store stop && rolvane store start", figures};
     return {"authority",
             left < kSoonDays * kDay ? State::note : State::well,
-            fmt::format("{} is good until {}.", whose, first.until.toISO8601()),
+            fmt::format("{} is good until {}.", whose, shownDate(first.until)),
             {},
             figures};
 }

@@ -1,6 +1,7 @@
 #include "FailureText.h"
 
 #include "AskAgain.h"
+#include "Texts.h"
 
 #include "engine/pass/StoreFailures.h"
 #include "store/dav/CXDAVManager.h"
@@ -11,69 +12,75 @@ namespace rolvane::cli {
 
 namespace {
 
-constexpr const char* kByItself = "The daemon tries again by itself.";
+const char* byItself() {
+    return translated("The daemon tries again by itself.");
+}
 
 std::string quoted(const std::string& words) {
     return words.empty() ? std::string() : " (\"" + words + "\")";
 }
 
 std::string nameOf(const FailureScene& scene) {
-    return scene.store.empty() ? "the store" : scene.store;
+    return scene.store.empty() ? translated("the store") : scene.store;
 }
 
 std::string until(const PassFailure& failure, const FailureScene& scene) {
-    if (!failure.retryAfterSeconds) return kByItself;
-    return fmt::format("It wants to be asked again at {}; the daemon does so by itself.",
-                       scene.at.addingSeconds(*failure.retryAfterSeconds).toISO8601());
+    if (!failure.retryAfterSeconds) return byItself();
+    return tr("It wants to be asked again at {}; the daemon does so by itself.",
+              shownDate(scene.at.addingSeconds(*failure.retryAfterSeconds)));
 }
 
 FailureText password(const FailureScene& scene, const std::string& words) {
     return {
-        kRefused,
-        fmt::format("{} refused the user name or the password of \"{}\"{}.", nameOf(scene), scene.self, quoted(words)),
-        "If the password was changed there, type `rolvane account set --ask-password`: the daemon then goes on by "
-        "itself."};
+        kRefused, tr("{} refused the user name or the password of \"{}\"{}.", nameOf(scene), scene.self, quoted(words)),
+        translated(
+            "If the password was changed there, type `rolvane account set --ask-password`: the daemon then goes on by "
+            "itself.")};
 }
 
 // Without an answer that can be believed.
 FailureText unanswered(const PassFailure& failure, const FailureScene& scene) {
     const std::string store = nameOf(scene);
-    const std::string asked = failure.method.empty() ? "" : fmt::format(" (asked for {})", failure.method);
+    const std::string asked = failure.method.empty() ? "" : tr(" (asked for {})", failure.method);
     switch (failure.error) {
-    case kCXDAVErrorTimedOut:
-        return {kUnreachable, fmt::format("{} did not answer in time{}.", store, asked), kByItself};
+    case kCXDAVErrorTimedOut: return {kUnreachable, tr("{} did not answer in time{}.", store, asked), byItself()};
     case kCXDAVErrorSecureConnection:
-        return {kUnreachable, fmt::format("There is no secure connection to {}{}.", store, quoted(failure.words)),
+        return {
+            kUnreachable, tr("There is no secure connection to {}{}.", store, quoted(failure.words)),
+            translated(
                 "Check the account's authority, with `rolvane account set --ca-file FILE`, and the host's name in the "
-                "endpoint. Nothing was sent."};
+                "endpoint. Nothing was sent.")};
     case kCXDAVErrorBadServerResponse:
         return {kUnreachable,
-                fmt::format("Whoever answers for {} is no WebDAV server{}{}.", store, asked, quoted(failure.words)),
-                "Where the network has a page to sign in, sign in there; else check the account's endpoint. "
-                "`rolvane account show` tells it."};
+                tr("Whoever answers for {} is no WebDAV server{}{}.", store, asked, quoted(failure.words)),
+                translated("Where the network has a page to sign in, sign in there; else check the account's endpoint. "
+                           "`rolvane account show` tells it.")};
     case kCXDAVErrorAuthentication: return password(scene, failure.words);
     case kCXDAVErrorNoPassword:
-        return {kRefused, fmt::format("The password of \"{}\" cannot be had{}.", scene.self, quoted(failure.words)),
-                "`rolvane account test` says why, `rolvane account set --ask-password` takes it anew."};
+        return {kRefused, tr("The password of \"{}\" cannot be had{}.", scene.self, quoted(failure.words)),
+                translated("`rolvane account test` says why, `rolvane account set --ask-password` takes it anew.")};
     case kCXDAVErrorNoAccount:
-        return {kNotFound, "There is no account on a store.", "`rolvane account set` makes one."};
+        return {kNotFound, translated("There is no account on a store."),
+                translated("`rolvane account set` makes one.")};
     case kCXDAVErrorCannotConnect: {
         const bool unknownName = failure.words.find("resolve") != std::string::npos;
-        return {kUnreachable, fmt::format("{} cannot be reached{}.", store, quoted(failure.words)),
+        return {kUnreachable, tr("{} cannot be reached{}.", store, quoted(failure.words)),
                 unknownName
-                    ? "Is this machine on the network? If it is, check the host's name in the account's "
-                      "endpoint: `rolvane account show` tells it."
-                    : "Look whether it runs, and whether this machine is on the network. " + std::string(kByItself)};
+                    ? translated("Is this machine on the network? If it is, check the host's name in the account's "
+                                 "endpoint: `rolvane account show` tells it.")
+                    : translated("Look whether it runs, and whether this machine is on the network. ") +
+                          std::string(byItself())};
     }
-    default: return {kUnreachable, fmt::format("{} could not be used{}.", store, quoted(failure.words)), kByItself};
+    default: return {kUnreachable, tr("{} could not be used{}.", store, quoted(failure.words)), byItself()};
     }
 }
 
 FailureText forbidden(const PassFailure& failure, const FailureScene& scene) {
-    const std::string what = fmt::format("The store does not allow {} (403){}.", failure.method, quoted(failure.words));
-    if (scene.user.empty()) return {kRefused, what, "Have the store's administrator let you use your own tree."};
+    const std::string what = tr("The store does not allow {} (403){}.", failure.method, quoted(failure.words));
+    if (scene.user.empty())
+        return {kRefused, what, translated("Have the store's administrator let you use your own tree.")};
     return {kRefused, what,
-            fmt::format("Ask {} for `rolvane share {}{}`.", scene.user, scene.self, scene.reads ? "" : " --write")};
+            tr("Ask {} for `rolvane share {}{}`.", scene.user, scene.self, scene.reads ? "" : " --write")};
 }
 
 } // namespace
@@ -86,45 +93,48 @@ FailureText failureText(const PassFailure& failure, const FailureScene& scene) {
     const bool isBusy = failure.status >= 500 || failure.status == 408 || failure.status == 429;
     if (failure.error == kCXDAVErrorBadServerResponse && !isBusy) return unanswered(failure, scene);
     const auto answered = [&](const char* meaning) {
-        return fmt::format("The store answered {} with {}{}{}.", failure.method, failure.status, meaning,
-                           quoted(failure.words));
+        return tr("The store answered {} with {}{}{}.", failure.method, failure.status, meaning, quoted(failure.words));
     };
     switch (failure.status) {
     case 404:
     case 409:
-        return {kFailed, answered(": the folder above is missing there"),
+        return {
+            kFailed, answered(translated(": the folder above is missing there")),
+            translated(
                 "The next pass makes the tree whole. If it is told again, check the account's endpoint, and have the "
-                "store's administrator look at the folder."};
+                "store's administrator look at the folder.")};
     case 405:
     case 501:
-        return {kFailed, answered(": it does not know this there"),
-                "Check the account's endpoint: WebDAV has to be switched on for the whole tree."};
-    case 408: return {kUnreachable, answered(": it waited too long"), kByItself};
+        return {kFailed, answered(translated(": it does not know this there")),
+                translated("Check the account's endpoint: WebDAV has to be switched on for the whole tree.")};
+    case 408: return {kUnreachable, answered(translated(": it waited too long")), byItself()};
     case 412:
-        return {kFailed, answered(": somebody else has changed the same at this moment"),
-                "The next pass looks at both and tries again."};
+        return {kFailed, answered(translated(": somebody else has changed the same at this moment")),
+                translated("The next pass looks at both and tries again.")};
     case 413:
-        return {kFailed, answered(": that is too large for it"),
-                "Have its administrator allow larger files, or make the contact's photo smaller."};
+        return {kFailed, answered(translated(": that is too large for it")),
+                translated("Have its administrator allow larger files, or make the contact's photo smaller.")};
     case 423:
-        return {kFailed, answered(": somebody else holds the lock of the tree"),
-                "The daemon tries again by itself; a lock that nobody gives back ends after five minutes."};
+        return {kFailed, answered(translated(": somebody else holds the lock of the tree")),
+                translated("The daemon tries again by itself; a lock that nobody gives back ends after five minutes.")};
     case 429:
-    case 503: return {kUnreachable, answered(": it is too busy"), until(failure, scene)};
+    case 503: return {kUnreachable, answered(translated(": it is too busy")), until(failure, scene)};
     case 507:
-        return {kFailed, answered(": it has no room left"),
-                "Make room there, or have the quota raised; the daemon tries again by itself."};
+        return {kFailed, answered(translated(": it has no room left")),
+                translated("Make room there, or have the quota raised; the daemon tries again by itself.")};
     default: break;
     }
     if (failure.status >= 500)
-        return {kUnreachable, answered(": it has failed"),
+        return {
+            kUnreachable, answered(translated(": it has failed")),
+            translated(
                 "The daemon tries again by itself. If it goes on, the store's administrator finds the reason in its "
-                "log."};
-    return {kFailed, answered(""), kByItself};
+                "log.")};
+    return {kFailed, answered(""), byItself()};
 }
 
 CommandError noAccount() {
-    return {kNotFound, "There is no account on a store yet. `rolvane account set` makes one."};
+    return {kNotFound, translated("There is no account on a store yet. `rolvane account set` makes one.")};
 }
 
 FailureScene sceneOfTheAccount(Date at) {
@@ -157,13 +167,15 @@ CommandError hinderedBy(const StoreTrial::Hindrance& hindrance, const std::strin
     using Remedy = StoreTrial::Hindrance::Remedy;
     const auto toDo = [&] {
         switch (hindrance.remedy) {
-        case Remedy::rights: return "Have the store's administrator let you use your own tree.";
-        case Remedy::locks: return "Have the server's locks turned off (it announces no class 2 then), or mended.";
+        case Remedy::rights: return translated("Have the store's administrator let you use your own tree.");
+        case Remedy::locks:
+            return translated("Have the server's locks turned off (it announces no class 2 then), or mended.");
         case Remedy::endpoint: break;
         }
-        return "Check the account's endpoint: it has to be a WebDAV folder for files of every kind. Servers for "
-               "address "
-               "books or calendars alone take none.";
+        return translated(
+            "Check the account's endpoint: it has to be a WebDAV folder for files of every kind. Servers for "
+            "address "
+            "books or calendars alone take none.");
     };
     const ExitCode code = hindrance.remedy == Remedy::rights ? kRefused
                           : hindrance.status == 0            ? kUnreachable

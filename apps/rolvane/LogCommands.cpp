@@ -6,6 +6,7 @@
 #include "SafeText.h"
 #include "Shares.h"
 #include "Subscriptions.h"
+#include "Texts.h"
 #include "ValueNames.h"
 
 #include "contacts/database/History.h"
@@ -198,7 +199,7 @@ void showLog(Context& context, const LogOptions& options) {
             all.push_back(data);
             continue;
         }
-        context.line(fmt::format("{:>4}  {}  {}  {}{}", change.number, change.date.toISO8601(), amountOf(change),
+        context.line(fmt::format("{:>4}  {}  {}  {}{}", change.number, shownDate(change.date), amountOf(change),
                                  shownLine(who), change.isUndone ? "  (taken back)" : ""));
         if (of)
             for (const CXChangeDetail& detail : details) tellDetail(context, history, detail);
@@ -263,7 +264,7 @@ void undo(Context& context, int64_t number, bool dryRun) {
     add(undone.changed, "changed back");
     add(undone.memberships,
         undone.memberships == 1 ? "membership or choice restored" : "memberships or choices restored");
-    context.say(fmt::format("Change {} of {}: {}.{}", change.number, change.date.toISO8601(),
+    context.say(fmt::format("Change {} of {}: {}.{}", change.number, shownDate(change.date),
                             what.empty() ? "nothing of it is left to take back" : what,
                             dryRun ? " Nothing was changed: this was a trial." : ""));
     if (!undone.left.empty()) context.exitCode = undone.anything() ? kPartly : kFailed;

@@ -4,6 +4,7 @@
 #include "SafeText.h"
 #include "Subscriptions.h"
 #include "Suggestions.h"
+#include "Texts.h"
 
 #include <algorithm>
 #include <fmt/format.h>
@@ -50,18 +51,20 @@ UniqueId only(const std::vector<CXListing>& found, const std::string& kind, cons
     if (found.empty()) {
         std::vector<std::string> names;
         for (const CXListing& listing : everybody()) names.push_back(shownLine(listing.displayName));
-        throw CommandError(kNotFound,
-                           fmt::format("There is no {} \"{}\".{} `rolvane {}` lists what there is.", kind, named,
-                                       didYouMean(suggestions(named, names)), kind == "group" ? "group list" : "list"));
+        const std::string like = didYouMean(suggestions(named, names));
+        throw CommandError(
+            kNotFound, kind == "group"
+                           ? tr("There is no group \"{}\".{} `rolvane group list` lists what there is.", named, like)
+                           : tr("There is no person \"{}\".{} `rolvane list` lists what there is.", named, like));
     }
     constexpr size_t kShown = 10;
     std::string list;
     for (size_t i = 0; i < std::min(found.size(), kShown); ++i)
         list +=
             fmt::format("\n  {}  {}{}", found[i].uniqueId.str(), shownLine(found[i].displayName), ownerMark(found[i]));
-    if (found.size() > kShown) list += fmt::format("\n  and {} more", found.size() - kShown);
-    throw CommandError(kNotFound, fmt::format("\"{}\" fits {} {}. Name one by its identifier:{}", named, found.size(),
-                                              kind == "person" ? "people" : "groups", list));
+    if (found.size() > kShown) list += tr("\n  and {} more", found.size() - kShown);
+    throw CommandError(kNotFound, tr("\"{}\" fits {} {}. Name one by its identifier:{}", named, found.size(),
+                                     kind == "person" ? translated("people") : translated("groups"), list));
 }
 
 } // namespace
@@ -104,7 +107,7 @@ void requireWritable(const CXRecord& record) {
 CXGroupRef findChangeableGroup(CXRolvane& database, const std::string& named, bool whole) {
     const CXGroupRef group = findGroup(database, named, whole);
     if (group->isAllGroup())
-        throw CommandError(kRefused, fmt::format("\"{}\" holds everybody; its members are not chosen.", group->name()));
+        throw CommandError(kRefused, tr("\"{}\" holds everybody; its members are not chosen.", group->name()));
     requireWritable(*group);
     return group;
 }

@@ -2,6 +2,7 @@
 
 #include "Counted.h"
 #include "FailureText.h"
+#include "Texts.h"
 
 #include "daemon/DaemonControl.h"
 #include "store/dav/CXDAVManager.h"
@@ -28,11 +29,11 @@ bool isOwn(const PassTree& tree) {
 }
 
 std::string contactsOf(const PassTree& tree) {
-    return isOwn(tree) ? "your own contacts" : tree.user.str() + "'s contacts";
+    return isOwn(tree) ? translated("your own contacts") : tr("{}'s contacts", tree.user.str());
 }
 
 std::string since(const PassDirection& direction) {
-    return direction.waitingSince ? " since " + direction.waitingSince->toISO8601() : std::string();
+    return direction.waitingSince ? tr(" since {}", shownDate(*direction.waitingSince)) : std::string();
 }
 
 FailureScene sceneOf(const PassTree& tree, bool incoming, Date at) {
@@ -65,13 +66,13 @@ bool reportStore(PassReport& report, const PassOutcome& outcome) {
     // A refused password ends the pass, and the process with it.
     if (outcome.exception && !(failure && text.code == kRefused))
         add(report, kFailed,
-            fmt::format("An error has ended the pass: {} What is left is kept for the next one. The log is {}.",
-                        *outcome.exception, DaemonControl::logPath()));
+            tr("An error has ended the pass: {} What is left is kept for the next one. The log is {}.",
+               *outcome.exception, DaemonControl::logPath()));
     if (outcome.storage)
         add(report, kFailed,
-            fmt::format("What the pass did could not be stored here: {} Nothing that was saved is lost; once this is "
-                        "cured, `rolvane sync` goes on.",
-                        *outcome.storage));
+            tr("What the pass did could not be stored here: {} Nothing that was saved is lost; once this is "
+               "cured, `rolvane sync` goes on.",
+               *outcome.storage));
     if (failure) add(report, text.code, text.what + " " + text.toDo);
     return failure.has_value();
 }
@@ -80,52 +81,58 @@ void reportOut(PassReport& report, const PassTree& tree, bool storeIsTold, Date 
     const PassDirection& out = tree.out;
     const FailureText text = out.why ? failureText(*out.why, sceneOf(tree, false, at)) : FailureText{kFailed, {}, {}};
     const std::string why = storeIsTold || !out.why ? std::string() : " " + text.what + " " + text.toDo;
-    if (out.waiting > 0)
-        add(report, text.code,
-            fmt::format("{} of {} {}{}{}.{}", counted(out.waiting, "change", "changes"), contactsOf(tree),
-                        out.waiting == 1 ? "waits" : "wait", since(out),
-                        storeIsTold ? std::string(", to be sent when the store can be reached again") : std::string(),
-                        why));
+    const std::string waiting = countedText(out.waiting, "change", "changes"), whose = contactsOf(tree);
+    const char* later = storeIsTold ? translated(", to be sent when the store can be reached again") : "";
+    if (out.waiting == 1)
+        add(report, text.code, tr("{} of {} waits{}{}.{}", waiting, whose, since(out), later, why));
+    else if (out.waiting > 0)
+        add(report, text.code, tr("{} of {} wait{}{}.{}", waiting, whose, since(out), later, why));
     if (tree.listsWait)
         add(report, text.code,
-            fmt::format("With whom you share was changed, and the store does not have it yet.{}",
-                        out.waiting > 0 ? "" : why));
-    if (out.refused > 0)
-        add(report, kRefused,
-            fmt::format("{} of {} {} refused: the store does not let you write there. {}",
-                        counted(out.refused, "change", "changes"), contactsOf(tree), out.refused == 1 ? "was" : "were",
-                        isOwn(tree) ? "Have the store's administrator let you write in your tree."
-                                    : fmt::format("Ask {} for `rolvane share {} --write`, then edit again.",
-                                                  tree.user.str(), CXDAVManager::vaultraUser())));
+            tr("With whom you share was changed, and the store does not have it yet.{}", out.waiting > 0 ? "" : why));
+    if (out.refused <= 0) return;
+    const std::string refused = countedText(out.refused, "change", "changes"),
+                      advice = isOwn(tree) ? translated("Have the store's administrator let you write in your tree.")
+                                           : tr("Ask {} for `rolvane share {} --write`, then edit again.",
+                                                tree.user.str(), CXDAVManager::vaultraUser());
+    add(report, kRefused,
+        out.refused == 1
+            ? tr("{} of {} was refused: the store does not let you write there. {}", refused, whose, advice)
+            : tr("{} of {} were refused: the store does not let you write there. {}", refused, whose, advice));
 }
 
 void reportIn(PassReport& report, const PassTree& tree, bool storeIsTold, Date at) {
     const PassDirection& in = tree.in;
     if (tree.ended)
-        return add(report, kRefused,
-                   isOwn(tree)
-                       ? "The publication has ended: the store has nothing of it any more, does not let you read "
-                         "it, or has another one in its place. `rolvane status` tells more, and `rolvane "
-                         "publish` publishes again."
-                       : fmt::format("{} no longer shares with you, and what came from there has left: "
-                                     "`rolvane withdrawn list` shows what is kept of it.",
-                                     tree.user.str()));
+        return add(
+            report, kRefused,
+            isOwn(tree)
+                ? translated("The publication has ended: the store has nothing of it any more, does not let you read "
+                             "it, or has another one in its place. `rolvane status` tells more, and `rolvane "
+                             "publish` publishes again.")
+                : tr("{} no longer shares with you, and what came from there has left: "
+                     "`rolvane withdrawn list` shows what is kept of it.",
+                     tree.user.str()));
     if (tree.leftAlone)
-        return add(report, kFailed,
-                   isOwn(tree) ? "Your tree on the store was older than expected, or incomplete; it is published again."
-                               : fmt::format("What the store holds of {} is older than expected, or incomplete. It is "
-                                             "taken in again when {}'s daemon has been there.",
-                                             tree.user.str(), tree.user.str()));
+        return add(
+            report, kFailed,
+            isOwn(tree)
+                ? translated("Your tree on the store was older than expected, or incomplete; it is published again.")
+                : tr("What the store holds of {} is older than expected, or incomplete. It is "
+                     "taken in again when {}'s daemon has been there.",
+                     tree.user.str(), tree.user.str()));
     const FailureText text = in.why ? failureText(*in.why, sceneOf(tree, true, at)) : FailureText{kFailed, {}, {}};
     const std::string why = storeIsTold || !in.why ? std::string() : " " + text.what + " " + text.toDo;
     if (storeIsTold && isOwn(tree)) return; // nobody waits for that
     if (in.asked && !in.reached)
         add(report, in.why ? text.code : kUnreachable,
-            fmt::format("News about {} could not be read{}.{}", contactsOf(tree), since(in), why));
+            tr("News about {} could not be read{}.{}", contactsOf(tree), since(in), why));
+    else if (in.waiting == 1)
+        add(report, text.code, tr("1 change to {} has not been taken in yet.{}", contactsOf(tree), why));
     else if (in.waiting > 0)
         add(report, text.code,
-            fmt::format("{} to {} {} not been taken in yet.{}", counted(in.waiting, "change", "changes"),
-                        contactsOf(tree), in.waiting == 1 ? "has" : "have", why));
+            tr("{} changes to {} have not been taken in yet.{}",
+               shownNumber(static_cast<unsigned long long>(in.waiting)), contactsOf(tree), why));
 }
 
 } // namespace
@@ -140,11 +147,13 @@ PassReport reportOf(const PassOutcome& outcome, bool sentOnly) {
     }
     if (!report.lines.empty()) return report;
     if (!sentOnly && outcome.full && !outcome.storeReached)
-        add(report, kUnreachable, "The store was not reached. The daemon tries again by itself.");
+        add(report, kUnreachable, translated("The store was not reached. The daemon tries again by itself."));
     else if (!sentOnly && outcome.anotherFollows)
-        add(report, kFailed, "Another pass is needed, and follows by itself. `rolvane status` tells how it went.");
+        add(report, kFailed,
+            translated("Another pass is needed, and follows by itself. `rolvane status` tells how it went."));
     else if (!sentOnly && !everythingIsUpToDate(outcome))
-        add(report, kFailed, "The pass carried changes alone and did not look at the trees. `rolvane sync` does.");
+        add(report, kFailed,
+            translated("The pass carried changes alone and did not look at the trees. `rolvane sync` does."));
     return report;
 }
 

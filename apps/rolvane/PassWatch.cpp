@@ -1,4 +1,5 @@
 #include "PassWatch.h"
+#include "Texts.h"
 
 #include "daemon/DaemonControl.h"
 
@@ -45,10 +46,10 @@ void DaemonPulse::check() {
     if (secondsSince(*_since) < kAnswerSeconds) return;
     _context.loop().runOnce(0); // the answer may lie there: it was this process that rested
     if (answered()) return;
-    throw CommandError(kUnreachable, fmt::format("RolvaneManager (process {}) runs, but does not answer: it was "
-                                                 "stopped, or hangs. `rolvane daemon restart` ends it and starts it "
-                                                 "anew; nothing that was saved is lost.",
-                                                 *process));
+    throw CommandError(kUnreachable, tr("RolvaneManager (process {}) runs, but does not answer: it was "
+                                        "stopped, or hangs. `rolvane daemon restart` ends it and starts it "
+                                        "anew; nothing that was saved is lost.",
+                                        *process));
 }
 
 PassWatch::PassWatch(Context& context, bool progress) : _context(context) {

@@ -3,6 +3,7 @@
 #include "FailureText.h"
 #include "PassReport.h"
 #include "Publication.h"
+#include "Texts.h"
 
 #include "daemon/DaemonControl.h"
 #include "store/dav/CXDAVManager.h"
@@ -19,9 +20,9 @@ constexpr const char* kDaemonProgram = "RolvaneManager";
 constexpr const char* kMakePass = "SimulateVaultraNotification";
 
 [[noreturn]] void endedWithoutAWord() {
-    throw CommandError(kFailed, fmt::format("RolvaneManager ended before the pass was done. What is left is kept; "
-                                            "`rolvane sync` goes on with it. Its log is {}.",
-                                            DaemonControl::logPath()));
+    throw CommandError(kFailed, tr("RolvaneManager ended before the pass was done. What is left is kept; "
+                                   "`rolvane sync` goes on with it. Its log is {}.",
+                                   DaemonControl::logPath()));
 }
 
 // The outcome of a pass of its own, or of one that a daemon made just before it ended.
@@ -81,9 +82,9 @@ PassOutcome waitForPass(Context& context, PassWatch& watch, OutcomeWatch& outcom
         seconds);
     watch.onEvent = nullptr;
     if (!done)
-        throw CommandError(kUnreachable, fmt::format("The daemon had not finished after {} seconds; it goes on by "
-                                                     "itself. `rolvane watch` shows how far it is.",
-                                                     seconds));
+        throw CommandError(kUnreachable, tr("The daemon had not finished after {} seconds; it goes on by "
+                                            "itself. `rolvane watch` shows how far it is.",
+                                            seconds));
     return *outcome;
 }
 
@@ -111,9 +112,9 @@ PassOutcome makePass(Context& context, double seconds) {
     const bool inTime = watch.waitUntil([&] { return passed() || !daemon.running(); }, seconds);
     watch.onEvent = nullptr;
     if (!inTime)
-        throw CommandError(kUnreachable, fmt::format("No pass ended within {} seconds. `rolvane daemon status` tells "
-                                                     "whether the daemon is at work.",
-                                                     seconds));
+        throw CommandError(kUnreachable, tr("No pass ended within {} seconds. `rolvane daemon status` tells "
+                                            "whether the daemon is at work.",
+                                            seconds));
     if (passed()) return *outcome;
     return outcomeOfOnce(watch, outcomes, seconds); // it was just ending
 }
@@ -133,13 +134,14 @@ void sync(Context& context, double seconds) {
     bool subscribed = false;
     for (const CXSubscriptionRef& s : context.database().subscriptions()) subscribed = subscribed || !s->isLocal();
     if (!publication.anything() && !subscribed) {
-        context.say("Nothing is published and nobody is subscribed to: there is nothing to bring up to date.");
+        context.say(
+            translated("Nothing is published and nobody is subscribed to: there is nothing to bring up to date."));
         return;
     }
     (void)ownBase(); // an account that cannot be used is told in its own words
     PassOutcome outcome = makePass(context, seconds);
     if (mayGoBetter(outcome)) outcome = makePass(context, seconds);
-    report(context, outcome, "Everything is up to date.");
+    report(context, outcome, translated("Everything is up to date."));
     if (context.json) context.print(outcomeJson(outcome));
 }
 

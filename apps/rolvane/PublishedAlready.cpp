@@ -1,5 +1,7 @@
 #include "PublishedAlready.h"
 
+#include "Texts.h"
+
 #include "conduits/PublishedLayout.h"
 #include "conduits/store/StoreComparison.h"
 #include "engine/memory/EngineState.h"
@@ -55,7 +57,7 @@ PublishedAlready publishedAlready(CXDAVManager& store, const Preferences& prefer
 }
 
 std::string publishedAlreadyText(const PublishedAlready& found) {
-    const std::string when = found.lastWrite ? fmt::format("; last written {}", found.lastWrite->toISO8601()) : "";
+    const std::string when = found.lastWrite ? fmt::format("; last written {}", shownDate(*found.lastWrite)) : "";
     switch (found.by) {
     case PublishedAlready::By::nobody: return "Nothing of this account is published yet.";
     case PublishedAlready::By::thisComputer:

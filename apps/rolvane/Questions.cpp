@@ -2,6 +2,7 @@
 
 #include "SafeText.h"
 #include "Terminal.h"
+#include "Texts.h"
 
 #include <algorithm>
 #include <charconv>
@@ -24,7 +25,7 @@ Questions::Questions(Context& context, bool mayAsk)
 
 std::string Questions::answer(const std::string& prompt) {
     const auto line = readLine(shownLine(prompt));
-    if (!line) throw CommandError(kFailed, "The answers ended here. Nothing was saved.");
+    if (!line) throw CommandError(kFailed, translated("The answers ended here. Nothing was saved."));
     return trimmed(*line);
 }
 
@@ -41,7 +42,7 @@ bool Questions::yes(const std::string& question, bool fallback) {
         if (given.empty()) return fallback;
         if (given == "y" || given == "yes") return true;
         if (given == "n" || given == "no") return false;
-        _context.warn("Answer y or n.");
+        _context.warn(translated("Answer y or n."));
     }
     return fallback;
 }
@@ -51,19 +52,19 @@ size_t Questions::choice(const std::string& question, const std::vector<std::str
     _context.warn(question);
     for (size_t i = 0; i < offered.size(); ++i) _context.warn(fmt::format("  {}  {}", i + 1, offered[i]));
     for (;;) {
-        const std::string given = answer(fmt::format("Number [{}]: ", fallback + 1));
+        const std::string given = answer(tr("Number [{}]: ", fallback + 1));
         if (given.empty()) return fallback;
         size_t number = 0;
         const auto [end, error] = std::from_chars(given.data(), given.data() + given.size(), number);
         if (error == std::errc() && end == given.data() + given.size() && number >= 1 && number <= offered.size())
             return number - 1;
-        _context.warn(fmt::format("Answer with a number from 1 to {}.", offered.size()));
+        _context.warn(tr("Answer with a number from 1 to {}.", offered.size()));
     }
 }
 
 std::string Questions::secret(const std::string& question) {
     const std::string given = readSecret(shownLine(question + ": "));
-    if (given.empty()) throw CommandError(kUsage, "The password is empty. Nothing was saved.");
+    if (given.empty()) throw CommandError(kUsage, translated("The password is empty. Nothing was saved."));
     return given;
 }
 

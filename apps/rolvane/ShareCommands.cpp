@@ -6,6 +6,7 @@
 #include "Shares.h"
 #include "Shown.h"
 #include "Subscriptions.h"
+#include "Texts.h"
 #include "ValueNames.h"
 
 #include "acl/CXDAVACLManager.h"
@@ -254,7 +255,7 @@ void listShares(Context& context) {
     };
     const auto since = [](const Json& share) {
         const auto date = [&](const char* key) {
-            return share[key].is_null() ? std::string("-") : share[key].get<std::string>();
+            return share[key].is_null() ? std::string("-") : shownDate(share[key].get<std::string>());
         };
         if (share["rights"].is_null()) return std::string();
         const std::string writes = share["rights"] == "write" ? ", writes since " + date("writesSince") : "";

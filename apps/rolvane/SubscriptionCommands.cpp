@@ -9,6 +9,7 @@
 #include "Shown.h"
 #include "Subscribe.h"
 #include "Subscriptions.h"
+#include "Texts.h"
 #include "ValueNames.h"
 
 #include "conduits/PublishedLayout.h"
@@ -229,9 +230,9 @@ void listSubscriptions(Context& context) {
     if (all.empty()) context.say("There is none. `rolvane subscribe USER` makes one.");
     for (const Json& s : all) {
         context.line(fmt::format("{}  {}", s["user"].get<std::string>(), s["location"].get<std::string>()));
-        context.line(
-            fmt::format("    {}, {}, {}", amount(s), s["writable"].get<bool>() ? "read and write" : "read only",
-                        s["lastSeen"].is_null() ? "not read yet" : "last seen " + s["lastSeen"].get<std::string>()));
+        context.line(fmt::format(
+            "    {}, {}, {}", amount(s), s["writable"].get<bool>() ? "read and write" : "read only",
+            s["lastSeen"].is_null() ? "not read yet" : "last seen " + shownDate(s["lastSeen"].get<std::string>())));
         if (const size_t pending = s["pending"]; pending > 0)
             context.line(fmt::format("    {} to be sent", counted(pending, "change waits", "changes wait")));
     }

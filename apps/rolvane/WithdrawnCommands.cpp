@@ -2,6 +2,7 @@
 #include "Context.h"
 #include "Counted.h"
 #include "ImportReport.h"
+#include "Texts.h"
 #include "ValueNames.h"
 #include "Withdrawn.h"
 
@@ -78,7 +79,7 @@ std::string withdrawnText(const Json& record) {
     const size_t people = record["people"], groups = record["groups"];
     return fmt::format("{}'s, {} and {}, on {}{}", record["user"].get<std::string>(),
                        counted(people, "person", "people"), counted(groups, "group", "groups"),
-                       record["date"].get<std::string>(),
+                       shownDate(record["date"].get<std::string>()),
                        record["file"].is_null() ? "" : ", kept in " + record["file"].get<std::string>());
 }
 

@@ -10,13 +10,12 @@
 #include "SeeingCommands.h"
 #include "SetupCommands.h"
 #include "Suggestions.h"
+#include "Texts.h"
 
+#include <algorithm>
 #include <iostream>
 
 namespace {
-
-constexpr const char* kDescription =
-    "Rolvane shares parts of your contacts with other people and keeps every copy in step.";
 
 constexpr const char* kFooter =
     R"(Data goes to standard output, messages to standard error. `rolvane COMMAND --help` tells more.
@@ -74,13 +73,22 @@ int endWith(const CLI::App& app, const CLI::ParseError& error, int argc, char** 
     return kUsage;
 }
 
+// Documents, candidates of the shells and manual pages are for programs: the same in every language.
+bool isForAPerson(int argc, char** argv) {
+    const std::string_view first = argc > 1 ? argv[1] : "";
+    return first != "complete" && first != "manual" &&
+           std::none_of(argv, argv + argc, [](const char* word) { return std::string_view(word) == "--json"; });
+}
+
 } // namespace
 
 int main(int argc, char** argv) {
     using namespace rolvane;
     using namespace rolvane::cli;
 
-    CLI::App app(kDescription, "rolvane");
+    if (isForAPerson(argc, argv)) useLanguageOfThePerson();
+    CLI::App app(translated("Rolvane shares parts of your contacts with other people and keeps every copy in step."),
+                 "rolvane");
     Context context;
     app.footer(exitCodeLines() + "\n" + kFooter);
     app.set_version_flag("--version", "rolvane " ROLVANE_VERSION);

@@ -64,6 +64,11 @@ TEST_F(Rights, AreGrantedLoweredAndTakenBackAndTheStoreHasThemWhenTheCommandRetu
 TEST_F(Rights, AreListedWithTheMomentsSinceWhichTheyHold) {
     const auto listed = [&] { return world.json({"shares"})[0]; };
     const auto begins = [](const nlohmann::json& date) { return Date::fromISO8601(date.get<std::string>()).value(); };
+    world.home.setVariable("TZ", "UTC0");
+    const auto shown = [](const nlohmann::json& date) { // local time
+        const std::string text = date.get<std::string>();
+        return text.substr(0, 10) + " " + text.substr(11, 8);
+    };
     const Date before = Clock::system().now();
     world.done({"publish"});
     world.done({"share", "bob"});
@@ -71,13 +76,13 @@ TEST_F(Rights, AreListedWithTheMomentsSinceWhichTheyHold) {
     EXPECT_GE(begins(reads).secondsSince(before), -1);
     EXPECT_GE(Clock::system().now().secondsSince(begins(reads)), 0);
     EXPECT_TRUE(listed()["writesSince"].is_null());
-    EXPECT_EQ(world.done({"shares"}), "bob  read  reads since " + reads.get<std::string>() + "\n");
+    EXPECT_EQ(world.done({"shares"}), "bob  read  reads since " + shown(reads) + "\n");
     world.done({"share", "bob", "--write"});
     const auto writes = listed()["writesSince"];
     EXPECT_GE(begins(writes).secondsSince(begins(reads)), 0);
     EXPECT_EQ(listed()["readsSince"], reads) << "a raised right has been read with for longer";
-    EXPECT_EQ(world.done({"shares"}), "bob  read and write  reads since " + reads.get<std::string>() +
-                                          ", writes since " + writes.get<std::string>() + "\n");
+    EXPECT_EQ(world.done({"shares"}),
+              "bob  read and write  reads since " + shown(reads) + ", writes since " + shown(writes) + "\n");
     world.done({"share", "bob", "--write"});
     EXPECT_EQ(listed()["writesSince"], writes) << "what is granted already keeps its date";
     world.done({"share", "bob"});

@@ -52,7 +52,7 @@ std::vector<std::string> comparable(const std::vector<std::string>& lines, const
     static const std::pair<std::regex, const char*> kVarying[] = {
         {std::regex("process \\d+"), "process N"},
         {std::regex("localhost:\\d+"), "localhost:N"},
-        {std::regex("\\d{4}-\\d\\d-\\d\\dT[0-9:]+Z"), "DATE"},
+        {std::regex("\\d{4}-\\d\\d-\\d\\d [0-9]{2}:[0-9:]+"), "DATE"},
         {std::regex("rolvane:1:[A-Za-z0-9_.-]+"), "LINE"},
         {std::regex("\\s+$"), ""},
     };

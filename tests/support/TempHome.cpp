@@ -51,6 +51,10 @@ TempHome::TempHome() {
         std::filesystem::create_directory(path() + "/" + below);
         std::filesystem::permissions(path() + "/" + below, std::filesystem::perms::owner_all);
     }
+    // English, whatever the developer speaks.
+    for (const char* name : {"LC_ALL", "LC_MESSAGES", "LC_TIME", "LC_NUMERIC", "LANGUAGE"})
+        setVariable(name, std::nullopt);
+    setVariable("LANG", "C.UTF-8");
     setVariable("DBUS_SESSION_BUS_ADDRESS", std::nullopt);
     setVariable("ROLVANE_LOG", "stderr");
     setVariable("ROLVANE_NEWS", "never"); // no pass comes unasked but in tests of that

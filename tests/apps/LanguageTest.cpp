@@ -1,0 +1,102 @@
+// The person's language: texts by the catalogs, dates in local time, numbers with separators; documents for programs
+// stay.
+
+#include "CommandWorld.h"
+
+#include "foundation/Date.h"
+
+#include <filesystem>
+#include <gmock/gmock.h>
+#include <regex>
+
+namespace rolvane::test {
+namespace {
+
+using testing::HasSubstr;
+
+struct Language : testing::Test {
+    // With a locale that the system's own definitions make, wherever it has generated it or not.
+    void speak(const std::string& locale) {
+        if (locale != "C") {
+            const std::string place = world.home / "locales";
+            std::filesystem::create_directories(place);
+            const Ran made = world.run({"localedef", "--no-archive", "-i", locale.substr(0, locale.find('.')), "-f",
+                                        "UTF-8", place + "/" + locale});
+            ASSERT_EQ(made.status, 0) << made;
+            world.home.setVariable("LOCPATH", place);
+        }
+        for (const char* other : {"LC_ALL", "LC_MESSAGES", "LC_TIME", "LC_NUMERIC", "LANGUAGE"})
+            world.home.setVariable(other, std::nullopt);
+        world.home.setVariable("LANG", locale);
+    }
+    CommandWorld world;
+};
+
+TEST_F(Language, OfTextsIsGermanOrFrenchWhereThePersonSpeaksIt) {
+    world.add("Ada");
+    speak("C");
+    EXPECT_THAT(world.done({"status"}), HasSubstr("Contacts       1 person, 0 groups\n"));
+    speak("de_DE.UTF-8");
+    EXPECT_THAT(world.done({"status"}), testing::AllOf(HasSubstr("Kontakte       1 Person, 0 Gruppen\n"),
+                                                       HasSubstr("Veröffentlicht nichts\n")));
+    EXPECT_THAT(world.done({"--help"}), HasSubstr("Personen nach Wörtern aus Name"));
+    EXPECT_TRUE(saysOnce(world.rolvane({"publish"}), kNoSuchThing, "Es gibt noch kein Konto auf einem Speicher."));
+    speak("fr_FR.UTF-8");
+    EXPECT_THAT(world.done({"status"}), HasSubstr("1 personne, 0 groupe\n")) << "none is one, in French";
+    EXPECT_TRUE(saysOnce(world.rolvane({"show", "Nobody"}), kNoSuchThing, "Il n'y a pas de personne « Nobody »."));
+}
+
+TEST_F(Language, OfTextsIsSpokenOnASystemThatHasNotMadeItsOwnFilesForIt) {
+    world.home.setVariable("LOCPATH", world.home / "none");
+    world.home.setVariable("LANG", "de_DE.UTF-8");
+    EXPECT_TRUE(saysOnce(world.rolvane({"publish"}), kNoSuchThing, "Es gibt noch kein Konto auf einem Speicher."));
+    world.home.setVariable("LANG", "xx_XX.UTF-8");
+    EXPECT_TRUE(saysOnce(world.rolvane({"publish"}), kNoSuchThing, "There is no account on a store yet."));
+}
+
+TEST_F(Language, OfDocumentsForProgramsIsTheSameEverywhere) {
+    world.add("Ada", {"--birthday", "1815-12-10"});
+    const std::vector<std::vector<std::string>> commands{{"status", "--json"},
+                                                         {"list", "--json", "--full"},
+                                                         {"--json", "log"},
+                                                         {"manual", "commands"},
+                                                         {"account", "show", "--json"}};
+    speak("C");
+    std::vector<Ran> plain;
+    for (const auto& command : commands) plain.push_back(world.rolvane(command));
+    speak("de_DE.UTF-8");
+    for (size_t i = 0; i < commands.size(); ++i) {
+        const Ran german = world.rolvane(commands[i]);
+        EXPECT_EQ(german.output, plain[i].output);
+        EXPECT_EQ(german.errors, plain[i].errors);
+    }
+}
+
+TEST_F(Language, OfDatesIsLocalTimeAsThePersonWritesIt) {
+    world.add("Ada");
+    world.home.setVariable("TZ", "Asia/Tokyo"); // nine hours ahead all year
+    const std::string date = world.json({"log"})[0]["date"];
+    const std::string there = Date::fromISO8601(date)->addingSeconds(9 * 3600).toISO8601(); // "2026-11-23T18:00:00Z"
+    const std::string day = there.substr(0, 10), time = there.substr(11, 8);
+    speak("C");
+    EXPECT_THAT(world.done({"log"}), HasSubstr(day + " " + time));
+    speak("de_DE.UTF-8");
+    EXPECT_THAT(world.done({"log"}),
+                HasSubstr(day.substr(8, 2) + "." + day.substr(5, 2) + "." + day.substr(0, 4) + " " + time));
+}
+
+TEST_F(Language, OfNumbersSeparatesThousands) {
+    std::string cards;
+    for (int i = 0; i < 1234; ++i)
+        cards += "BEGIN:VCARD\r\nVERSION:3.0\r\nFN:P" + std::to_string(i) + "\r\nN:;P" + std::to_string(i) +
+                 ";;;\r\nEND:VCARD\r\n";
+    world.done({"import", "-q", world.write("cards.vcf", cards)});
+    speak("C");
+    EXPECT_THAT(world.done({"status"}), HasSubstr(" 1234 people"));
+    speak("de_DE.UTF-8");
+    EXPECT_THAT(world.done({"status"}), HasSubstr(" 1.234 Personen"));
+    EXPECT_EQ(world.json({"status"})["people"], 1234);
+}
+
+} // namespace
+} // namespace rolvane::test
