@@ -25,9 +25,7 @@ struct Context::Impl {
     bool opened = false;
 };
 
-Context::Context() : _impl(std::make_unique<Impl>()) {
-    Preferences::shared().keepElsewhere(daemonMemory());
-}
+Context::Context() : _impl(std::make_unique<Impl>()) {}
 
 Context::~Context() {
     if (_impl->opened) CXRolvane::closeShared();
@@ -128,6 +126,7 @@ CLI::App* addCommand(CLI::App& parent, Context& context, const std::string& name
     if (declare) declare(*command);
     if (body)
         command->final_callback([&context, path = pathOf(*command), body = std::move(body)] {
+            Preferences::shared().keepElsewhere(daemonMemory()); // makes its directory, which --help does not need
             context.command = path;
             body();
         });

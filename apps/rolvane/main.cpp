@@ -12,6 +12,9 @@
 #include "Suggestions.h"
 #include "Texts.h"
 
+#include "contacts/database/DaemonMemory.h"
+#include "foundation/Preferences.h"
+
 #include <algorithm>
 #include <iostream>
 
@@ -120,7 +123,10 @@ int main(int argc, char** argv) {
     addHelpCommand(app, context);
 
     try {
-        if (argc > 1 && std::string_view(argv[1]) == "complete") return complete(app, argc, argv);
+        if (argc > 1 && std::string_view(argv[1]) == "complete") {
+            Preferences::shared().keepElsewhere(daemonMemory());
+            return complete(app, argc, argv);
+        }
         if (argc > 1 && std::string_view(argv[1]) == "manual") return manual(app, argc, argv);
         app.parse(argc, argv);
         std::cout.flush();

@@ -1,5 +1,6 @@
 #include "CommandWorld.h"
 
+#include <filesystem>
 #include <regex>
 
 namespace rolvane::test {
@@ -98,6 +99,18 @@ TEST_F(CommandLine, AValueThatIsOutOfRangeIsRefused) {
 
 TEST_F(CommandLine, TheVersionIsData) {
     EXPECT_TRUE(std::regex_match(world.done({"--version"}), std::regex("rolvane [0-9]+\\.[0-9]+.*\n")));
+}
+
+TEST_F(CommandLine, WhoAsksForVersionOrHelpAloneFindsNothingNewAtHome) {
+    for (const char* question : {"--version", "--help"}) world.done({question});
+    world.rolvane({});
+    size_t found = 0;
+    for (const auto& each : std::filesystem::recursive_directory_iterator(world.home.path()))
+        if (!each.is_directory() || each.path().filename() == "rolvane") {
+            ADD_FAILURE() << each.path();
+            ++found;
+        }
+    EXPECT_EQ(found, 0U);
 }
 
 TEST_F(CommandLine, JsonMayStandBeforeOrBehindTheCommand) {
