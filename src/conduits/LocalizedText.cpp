@@ -29,6 +29,11 @@ const std::map<std::string_view, const char*>& builtInTexts() {
         {"SHARING_ENDED_REPLACED",
          "On the store lies another publication of yours, made from another computer perhaps. Your contacts stay as "
          "they are on this computer, and nothing there was changed. \"rolvane publish\" publishes them from here."},
+        {"SHARING_ENDED_ELSEWHERE", "They were taken off the store on another computer of yours, or are gone there. "
+                                    "Your contacts stay as they are "
+                                    "on this computer. \"rolvane publish\" publishes them again; where the other "
+                                    "computer has published them anew, "
+                                    "\"rolvane join\" keeps this one in step with it."},
         {"SHARING_ENDED_RIGHTS", "You have taken rights away from {users}, and the store does not know of it yet: they "
                                  "may still read what is left there. After \"rolvane publish\", \"rolvane unshare\" "
                                  "takes the rights away there."},

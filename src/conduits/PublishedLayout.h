@@ -15,6 +15,7 @@
 //   <group>/info              a group's information dictionary (the same path is a file and a directory)
 //   <group>/<person>          a member's marker
 //   info, dateFile            the tree's own information; the clock file, which is also what is locked
+//   computers                 which computers of its owner keep the tree in step, see store/ComputersOnStore.h
 //
 // Every dictionary file is an XML property list.
 namespace rolvane::layout {

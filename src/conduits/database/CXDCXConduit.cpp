@@ -1,6 +1,7 @@
 #include "conduits/database/CXDCXConduit.h"
 
 #include "conduits/PublishedLayout.h"
+#include "conduits/TakingIn.h"
 #include "conduits/database/ChangeCapture.h"
 #include "conduits/database/ContactReader.h"
 #include "conduits/database/GroupComparison.h"
@@ -10,6 +11,7 @@
 #include "contacts/records/Constants.h"
 #include "contacts/records/Identifier.h"
 #include "foundation/Preferences.h"
+#include "model/Computers.h"
 #include "model/PayloadKeys.h"
 #include "model/RemoteLocationMap.h"
 
@@ -70,6 +72,8 @@ ChangeCapture CXDCXConduit::newCapture() const {
 void CXDCXConduit::open() {
     _lastSyncDate = _world.preferences.get(kDaemonDomain, kLastSyncDateKey).date().value_or(Date::distantPast());
     _scan.reset();
+    _takesIn = false;
+    _isOneOfSeveral = isOneOfSeveral(_world.preferences);
     _publishers.clear();
     // A trickle pass has gathered before it opens the conduits.
     const int64_t now = rolvane().journalPosition();
@@ -80,6 +84,9 @@ void CXDCXConduit::open() {
 void CXDCXConduit::close() {
     rolvane().save();
     CXDConduit::close();
+    _captured = 0;
+    _written.clear();
+    if (_takesIn) return; // the next scan looks behind the same date
     _lastSyncDate = _world.clock.now();
     _world.preferences.set(kDaemonDomain, kLastSyncDateKey, *_lastSyncDate);
     _world.preferences.synchronize(kDaemonDomain);
@@ -88,18 +95,19 @@ void CXDCXConduit::close() {
         _lastScan = _scan->journalPosition;
     }
     _scan.reset();
-    _captured = 0;
-    _written.clear();
 }
 
 CXDChangeRecords CXDCXConduit::changeRecords() {
     engine().checkCXShareCount();
+    _takesIn = isTakingIn(engine(), _world.preferences, rolvane());
+    if (_takesIn) return {};
     const Date since = _lastSyncDate.value_or(Date::distantPast());
+    const bool hasTakenIn = scansAfterTakingIn(engine());
     const bool everything = forgetWhatIsPublishedAgain();
     // The journal's end and the rows are of one moment: a save is either before both or behind both.
     const CXRolvane::OneMoment moment(rolvane());
     const Scan scan{rolvane().journalPosition(), since};
-    const Date ownSince = everything ? Date::distantPast() : since;
+    const Date ownSince = everything || hasTakenIn ? Date::distantPast() : since;
     const auto states = engine().stateGeneration();
     const auto now = states ? std::optional(Moment{scan.journalPosition, *states}) : std::nullopt;
     const bool isAsBefore = now && !everything && now == _foundNothing;
@@ -223,6 +231,7 @@ void CXDCXConduit::rolvaneChanged(const Notification& notification) {
     engine().updateStateAndExitIfNeeded();
     if (notification.userInfo[kCXSenderProcessID].integer() == _world.processID) return;
     engine().checkCXShareCount();
+    if (isTakingIn(engine(), _world.preferences, rolvane())) return engine().bringSourcesUpToDate(); // scanned later
     _captured = rolvane().journalPosition();
 
     const Array inserted = notification.userInfo[kCXInsertedRecords].array();

@@ -144,6 +144,8 @@ private:
     Dictionary priorState() const;
     ChangeCapture newCapture() const;
     bool forgetWhatIsPublishedAgain(); // true: there is something
+    // A writer's change of the owner's lists is none; that of another computer of the owner is.
+    void changeOwnList(const CXDChangeRecord& record, const char* property);
     bool saysSomething(const CXSubscription& subscription) const;
     void addAllGroups(ChangeCapture& capture);
     void addUnsettledGroups(ChangeCapture& capture);
@@ -167,6 +169,8 @@ private:
 
     World _world;
     bool _readOnlyKillSwitch = false;
+    bool _isOneOfSeveral = false; // other computers of the owner write to the tree; as of the last open
+    bool _takesIn = false;        // this pass takes the owner's tree in, and has scanned nothing
     std::optional<Scan> _scan;
     std::optional<Moment> _foundNothing;      // of the last scan, if so
     int64_t _lastScan = 0;                    // the journal's position at the scan of the pass before, in this process

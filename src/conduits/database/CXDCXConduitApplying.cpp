@@ -8,12 +8,14 @@
 #include "contacts/records/Constants.h"
 #include "contacts/records/ContactMerge.h"
 #include "contacts/records/Identifier.h"
+#include "contacts/records/SharingDates.h"
 #include "foundation/Log.h"
 #include "foundation/PropertyList.h"
 #include "model/PayloadKeys.h"
 #include "model/RemoteLocationMap.h"
 
 #include <array>
+#include <string_view>
 
 namespace rolvane {
 namespace {
@@ -43,6 +45,24 @@ bool saysNothing(const CXDChangeRecord& record, const Dictionary& content) {
     return true;
 }
 
+// Since when the users of a list are on it, as far as this computer knows.
+void noteSharingDates(CXAllGroup& group, const char* list, const Dictionary& differences, Date now) {
+    const char* property = std::string_view(list) == kCXReadSharingACLProperty ? kCXReadSharingDatesProperty
+                                                                               : kCXReadWriteSharingDatesProperty;
+    const auto held = group.multiValueForProperty(property);
+    CXMutableMultiValue dates = held ? CXMutableMultiValue(*held) : CXMutableMultiValue();
+    const auto isIn = [&](const char* key, const std::string& user) {
+        return differences[key].array().contains(Value(user));
+    };
+    for (size_t i = dates.count(); i-- > 0;)
+        if (isIn(kDeletions, dates.labelAtIndex(i)) || isIn(kAdditions, dates.labelAtIndex(i))) dates.removeAtIndex(i);
+    for (const Value& added : differences[kAdditions].array()) dates.addValue(now, added.string());
+    if (!dates.empty())
+        group.setValue(dates, property);
+    else if (held)
+        group.removeValueForProperty(property);
+}
+
 } // namespace
 
 bool CXDCXConduit::applyChangeRecord(const CXDChangeRecordPtr& record, bool* /*denied*/) {
@@ -53,7 +73,7 @@ bool CXDCXConduit::applyChangeRecord(const CXDChangeRecordPtr& record, bool* /*d
 }
 
 bool CXDCXConduit::dispatch(const CXDChangeRecordPtr& record) {
-    if (_readOnlyKillSwitch && record->user() == kSelf) {
+    if (_readOnlyKillSwitch && !_isOneOfSeveral && record->user() == kSelf) {
         CXDLog("kill switch caught bogus record: %@", record);
         return true;
     }
@@ -115,7 +135,8 @@ bool CXDCXConduit::hasUncapturedEdit(const UniqueId& uid) {
 }
 
 bool CXDCXConduit::swallows(const CXDChangeRecord& record) const {
-    return _readOnlyKillSwitch && record.user() == kSelf && record.initialSource() != CXDSyncSourceCX;
+    return _readOnlyKillSwitch && !_isOneOfSeveral && record.user() == kSelf &&
+           record.initialSource() != CXDSyncSourceCX;
 }
 
 bool CXDCXConduit::holds(const CXDChangeRecord& record) {
@@ -323,10 +344,29 @@ bool CXDCXConduit::updateDistributionList(const CXDChangeRecordPtr& record) {
 // Who may read is the store's matter; the database keeps what its own user may do.
 bool CXDCXConduit::changeGroupReadACL(const CXDChangeRecordPtr& record) {
     if (!namesAllGroup(*record)) groupOf(*record);
+    changeOwnList(*record, kCXReadSharingACLProperty);
     return true;
 }
 
+void CXDCXConduit::changeOwnList(const CXDChangeRecord& record, const char* property) {
+    if (!_isOneOfSeveral || record.user() != kSelf || !namesAllGroup(record)) return;
+    const CXAllGroupRef group = rolvane().allGroup();
+    const auto held = group->multiValueForProperty(property);
+    CXMutableMultiValue list = held ? CXMutableMultiValue(*held) : CXMutableMultiValue();
+    const Dictionary differences = record.inMemoryPayload().dictionary();
+    for (size_t i = list.count(); i-- > 0;)
+        if (differences[kDeletions].array().contains(list.valueAtIndex(i))) list.removeAtIndex(i);
+    for (const Value& added : differences[kAdditions].array())
+        if (!list._allValues().contains(added)) list.addValue(added, added.string());
+    if (!list.empty())
+        group->setValue(list, property);
+    else if (group->valueForProperty(property))
+        group->removeValueForProperty(property);
+    noteSharingDates(*group, property, differences, _world.clock.now());
+}
+
 bool CXDCXConduit::changeGroupReadWriteACL(const CXDChangeRecordPtr& record) {
+    changeOwnList(*record, kCXReadWriteSharingACLProperty);
     const CXDConduit* store = engine().conduitForSyncSource(record->initialSource());
     const std::optional<Url> base = store ? store->baseLocationForUser(record->user()) : std::nullopt;
     if (!base) return true;

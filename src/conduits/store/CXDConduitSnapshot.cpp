@@ -2,6 +2,8 @@
 
 #include "conduits/CXDConduit.h"
 #include "conduits/PublishedLayout.h"
+#include "conduits/TakingIn.h"
+#include "conduits/store/ComputersOnStore.h"
 #include "conduits/store/StoreComparison.h"
 #include "conduits/store/TreeCondition.h"
 #include "contacts/database/CXRolvane.h"
@@ -185,11 +187,14 @@ std::optional<Dictionary> CXDConduit::fetchWorkingState(const Url& base, bool* f
     const ReadingGroupsAhead ahead(*manager, base, *listing);
     const std::string infoPath = base.cxURLByAppendingComponent(layout::kInfo).path();
     const std::string clockPath = layout::dateFileLocation(base).path();
+    const std::string computersPath = base.cxURLByAppendingComponent(ComputersOnStore::kFile).path();
     const std::string bucketsPath = base.cxURLByAppendingComponent(layout::kPeople).path() + "/";
     for (const auto& [path, file] : *listing) {
         const std::string name = nameOf(path, file);
         if (file.stored && (path == infoPath || path == clockPath))
             state.dictionaryFor(kTreeDates).set(name, *file.stored);
+        if (file.stored && path == computersPath)
+            state.set(ComputersOnStore::kFile, file.etag.empty() ? file.stored->toISO8601() : file.etag.str());
         if (isASpecialFile(name) || name == layout::kPeople) continue;
         const bool isGroup = name.ends_with(kGroupSuffix);
         if (!isGroup && !name.ends_with(kPersonSuffix)) continue;
@@ -287,11 +292,13 @@ void CXDConduit::compareUser(const UserName& user, const Dictionary& prior, cons
         return;
     }
     before.set(kSerialNumber, serial);
+    const bool allIsNew = known == nullptr || known->contains(kAllIsNew);
+    before.remove(kAllIsNew);
 
     const CXDChangeRecords lists = changeRecordsForACLAtRemoteLocation(*base);
     records.insert(records.end(), lists.begin(), lists.end());
 
-    StoreUser who{user, baseText, conduitSource(), known == nullptr, _lastSyncDate, {}, {}};
+    StoreUser who{user, baseText, conduitSource(), allIsNew, _lastSyncDate, {}, {}};
     who.mayWrite = [&] {
         const auto manager = ACLManagerForRemoteLocation(*base);
         if (!manager) return false;

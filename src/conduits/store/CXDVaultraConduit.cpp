@@ -144,16 +144,18 @@ void CXDVaultraConduit::open() {
     }
     _lastSyncDate = _world.preferences.get(kDaemonDomain, kLastSyncDateKey).date().value_or(Date::distantPast());
     if (_vaultraOffLine) return;
+    openAsOneOfSeveral();
     _isWrittenByOthers = somebodyMayWrite();
     forgetSubscribersRights();
     const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
     _world.manager.keepSerialNumber(users[kSelf.str()].dictionary()[kSerialNumber].string());
-    lookAfterStructure(gathering && !users.contains(kSelf.str()));
+    if (!_takesIn) lookAfterStructure(gathering && !users.contains(kSelf.str()));
 }
 
 void CXDVaultraConduit::willClose() {
     const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
-    if (_vaultraOffLine || _serverDate.valid() || users.contains(kSelf.str()) || isToBePublishedAgain()) return;
+    if (_vaultraOffLine || _serverDate.valid() || users.contains(kSelf.str()) || isToBePublishedAgain() || _takesIn)
+        return;
     _serverDate = std::async(std::launch::async, [this] { return currentServerDate(); });
 }
 
@@ -162,6 +164,7 @@ void CXDVaultraConduit::close() {
     awaitStructure();
     _world.manager.expectNothing();
     if (_vaultraOffLine) return;
+    if (_takesIn) return closeTakingIn();
     if (isToBePublishedAgain()) return;
     std::optional<Date> now = _serverDate.valid() ? _serverDate.get() : std::nullopt;
     if (!now) now = currentServerDate();

@@ -144,6 +144,14 @@ private:
     bool isBeingMended();
     bool isMended(const Dictionary& prior, const Dictionary& state);
     bool isToBePublishedAgain();
+    // -- the own tree of several computers
+    void openAsOneOfSeveral();
+    bool takesIn(Dictionary prior, const Dictionary& state);               // may the tree be taken in?
+    bool keepsInStepWithOthers(Dictionary prior, const Dictionary& state); // false: found out just now
+    bool hasTold(const Value& serial);                                     // the tree with that number of this computer
+    bool isToTellAgain(const Value& serial);
+    void closeTakingIn();
+    void isOneOfSeveralNoMore();
     void mendOwnTree(const Dictionary& prior, const Dictionary& state);
     void takeUnlistedAway(Dictionary prior, const Dictionary& state);
     void noteUnlisted(const UniqueId& name);
@@ -191,6 +199,10 @@ private:
     std::atomic<bool> _vaultraOffLine = false;
     std::atomic<bool> _isWrittenByOthers = false; // the own tree, as of the last open
     std::atomic<bool> _isOlderCopy = false;       // the own tree: it is older than the database
+    std::atomic<bool> _ownTreeIsHeld = false;     // nothing of ours is written there yet
+    bool _isOneOfSeveral = false;                 // as of the last look; constant while a pass writes, as are these two
+    bool _takesIn = false;                        // this pass does nothing else with the own tree
+    std::optional<Date> _takenIn;                 // the tree, as it was at that date
     std::set<UserName> _setBack;                  // other trees that are, as this pass has seen; main thread
     CXDChangeRecords _leftovers;                  // of the gathering that is under way
     std::set<UniqueId> _foundAgain;               // contacts that the next look takes away, too; of this gathering

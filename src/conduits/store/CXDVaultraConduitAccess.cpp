@@ -7,10 +7,12 @@
 #include "conduits/PublishedLayout.h"
 #include "conduits/UserAlert.h"
 #include "conduits/store/EndedPublication.h"
+#include "conduits/store/StoreComparison.h"
 #include "contacts/database/CXRolvane.h"
 #include "contacts/records/Constants.h"
 #include "foundation/Log.h"
 #include "foundation/Preferences.h"
+#include "model/Computers.h"
 #include "model/PayloadKeys.h"
 #include "model/RemoteLocationMap.h"
 #include "store/dav/CXDAVManager.h"
@@ -154,7 +156,11 @@ void CXDVaultraConduit::ownPublicationEnds(const Url& base, bool replaced) {
     };
     const Array readers = taken(kCXReadSharingACLProperty), writers = taken(kCXReadWriteSharingACLProperty);
     const Dictionary unsaved = _world.preferences.get(kDaemonDomain, kUnsavedAccessListsKey).dictionary();
-    EndedPublication ended{_world.clock.now(), replaced, {}};
+    EndedPublication ended{_world.clock.now(), replaced, {}, _isOneOfSeveral};
+    isOneOfSeveralNoMore();
+    const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
+    if (const Value& serial = users[kSelf.str()].dictionary()[kSerialNumber]; serial.isString() && !replaced)
+        _world.preferences.set(kDaemonDomain, kCXDFormerTree, serial);
     if (replaced) {
         const Array before = arrayOf(CXDAVACLManager::deniedIn(unsaved[base.absoluteString()].array()));
         for (const Value& name : cxArrayCombinedWithArray(before, cxArrayCombinedWithArray(readers, writers)))

@@ -53,7 +53,8 @@ bool CXDVaultraConduit::lockStructureForRecord(const CXDChangeRecord& record) {
 
 bool CXDVaultraConduit::applyChangeRecord(const CXDChangeRecordPtr& record, bool* denied) {
     if (denied) *denied = false;
-    if (_vaultraOffLine || !lockStructureForRecord(*record)) return false;
+    if (_vaultraOffLine || (_ownTreeIsHeld && record->changeMadeByDataOwner()) || !lockStructureForRecord(*record))
+        return false;
     int code = 0;
     const bool applied = mayBeNamed(record) ? apply(*record, code) : true;
     if (denied) *denied = code == kForbidden;
@@ -240,6 +241,8 @@ bool CXDVaultraConduit::writeComposite(CXDChangeRecord& record, const Dictionary
     if (!state && code == kMissing) {
         const bool isList = record.group()->str() == layout::kAllGroup;
         if (isList && !record.changeMadeByDataOwner()) return false; // it waits for its owner's
+        // Another computer would take a list of one change alone for the removal of everybody else.
+        if (isList && _isOneOfSeveral && lastKnownState(record).empty()) return false;
         if (wasDeletedThere(record)) return true;
     }
     // A part alone would be taken for all of it.

@@ -4,6 +4,7 @@
 #include "conduits/store/CXDVaultraConduit.h"
 
 #include "conduits/PublishedLayout.h"
+#include "conduits/TakingIn.h"
 #include "conduits/store/EndedPublication.h"
 #include "conduits/store/StoreComparison.h"
 #include "conduits/store/TreeCondition.h"
@@ -50,6 +51,7 @@ bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state)
     const Dictionary* known = users[user.str()].dictionaryIf();
     if (!known) return true;
     Dictionary prior = *known;
+    if (isOwn && _takesIn) return takesIn(prior, state);
     if (isOwn && !isMended(prior, state)) return false;
     const Value knownSerial = prior[kSerialNumber], serial = state[kSerialNumber];
     if (!serial.isString() || (knownSerial.isString() && knownSerial != serial)) return true; // no tree, or another one
@@ -59,6 +61,7 @@ bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state)
     const Value looked = prior[kLookAgain];
     prior.remove(kLookAgain);
     if (condition.isSound()) {
+        if (isOwn && !keepsInStepWithOthers(prior, state)) return false;
         prior.set(kTreeDates, state[kTreeDates].dictionary());
         _read.emplace(user, state);
         if (isOwn) mendOwnTree(prior, state);
@@ -103,6 +106,10 @@ std::optional<CXDVaultraConduit::Comparison> CXDVaultraConduit::comparisonWith(c
 
 bool CXDVaultraConduit::isUnchanged(const UserName& user, const Url& base) {
     const auto before = _foundNothing.find(user);
+    if (user == kSelf && _isOneOfSeveral) {
+        const Dictionary known = engine().conduitObjectForKey(kConduitVaultra, kPriorState)[user.str()].dictionary();
+        if (isToTellAgain(known[kSerialNumber])) return false;
+    }
     if (before == _foundNothing.end() || comparisonWith(user, base, true) != before->second) return false;
     const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
     Dictionary prior = users[user.str()].dictionary();
@@ -207,7 +214,7 @@ bool CXDVaultraConduit::isMended(const Dictionary& prior, const Dictionary& stat
 }
 
 bool CXDVaultraConduit::somebodyMayWrite() {
-    return allGroupHas(kCXReadWriteSharingACLProperty);
+    return _isOneOfSeveral || allGroupHas(kCXReadWriteSharingACLProperty);
 }
 
 // Empty lists stay where somebody was or something stood once.
@@ -218,6 +225,7 @@ bool CXDVaultraConduit::allGroupHas(const char* property) {
 
 CXDChangeRecords CXDVaultraConduit::changeRecords() {
     const int64_t journal = _world.rolvane.journalPosition(); // of before: what is saved meanwhile counts as unseen
+    if (_takesIn) beginTakingIn(engine(), _world.rolvane);
     CXDChangeRecords records = CXDConduit::changeRecords();
     if (_world.rolvane.allGroup()->valueForProperty(kCXRemoteLocationProperty) && endedPublication(_world.preferences))
         _world.preferences.remove(kDaemonDomain, kCXDEndedPublication); // published again since
@@ -232,6 +240,9 @@ CXDChangeRecords CXDVaultraConduit::changeRecords() {
         for (const CXDChangeRecordPtr& record : *some)
             if (record->user()) changed.insert(*record->user());
     noteWithoutChanges(journal, changed);
+    if (const auto own = _read.find(kSelf); _takesIn && own != _read.end())
+        _takenIn =
+            own->second[kTreeDates].dictionary()[std::string(layout::kDateFile)].date().value_or(Date::distantPast());
     _read.clear();
     records.insert(records.end(), _leftovers.begin(), _leftovers.end());
     _leftovers.clear();

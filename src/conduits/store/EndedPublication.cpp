@@ -8,7 +8,8 @@
 namespace rolvane {
 namespace {
 
-constexpr const char *kDate = "date", *kReplaced = "replaced", *kMayStillRead = "mayStillRead";
+constexpr const char *kDate = "date", *kReplaced = "replaced", *kMayStillRead = "mayStillRead",
+                     *kHadOthers = "hadOthers";
 
 // "anna", "anna and bert", "anna, bert and carla".
 std::string enumerated(const std::vector<UserName>& names) {
@@ -24,7 +25,7 @@ std::optional<EndedPublication> endedPublication(const Preferences& preferences)
     const Dictionary note = preferences.get(kDaemonDomain, kCXDEndedPublication).dictionary();
     const auto when = note[kDate].date();
     if (!when) return std::nullopt;
-    EndedPublication ended{*when, note[kReplaced].boolean(), {}};
+    EndedPublication ended{*when, note[kReplaced].boolean(), {}, note[kHadOthers].boolean()};
     for (const Value& name : note[kMayStillRead].array()) ended.mayStillRead.emplace_back(name.string());
     return ended;
 }
@@ -32,15 +33,18 @@ std::optional<EndedPublication> endedPublication(const Preferences& preferences)
 void noteEndedPublication(Preferences& preferences, const EndedPublication& ended) {
     Array names;
     for (const UserName& name : ended.mayStillRead) names.append(name);
-    preferences.set(kDaemonDomain, kCXDEndedPublication,
-                    Dictionary{{kDate, ended.when}, {kReplaced, ended.replaced}, {kMayStillRead, names}});
+    Dictionary note{{kDate, ended.when}, {kReplaced, ended.replaced}, {kMayStillRead, names}};
+    if (ended.hadOthers) note.set(kHadOthers, true);
+    preferences.set(kDaemonDomain, kCXDEndedPublication, note);
     preferences.synchronize(kDaemonDomain);
 }
 
 UserAlert::Text noticeOf(const EndedPublication& ended) {
     UserAlert::Text text;
     text.header = localizedText("SHARING_ENDED_HEADER");
-    text.message = localizedText(ended.replaced ? "SHARING_ENDED_REPLACED" : "SHARING_ENDED");
+    text.message = localizedText(ended.hadOthers  ? "SHARING_ENDED_ELSEWHERE"
+                                 : ended.replaced ? "SHARING_ENDED_REPLACED"
+                                                  : "SHARING_ENDED");
     if (!ended.mayStillRead.empty())
         text.message += " " + localizedText("SHARING_ENDED_RIGHTS", {{"users", enumerated(ended.mayStillRead)}});
     text.defaultButton = localizedText("OK");

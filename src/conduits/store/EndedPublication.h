@@ -17,10 +17,11 @@ struct EndedPublication {
     Date when;
     bool replaced = false;              // another publication lies in its place; else it is gone or forbidden
     std::vector<UserName> mayStillRead; // the owner has taken their rights away, and the store does not know of it
+    bool hadOthers = false;             // other computers of the owner kept it in step, and one has withdrawn it
 };
 
 // Kept in the daemon's domain until a pass has found something published again:
-//   { "date": date, "replaced": boolean, "mayStillRead": [name] }
+//   { "date": date, "replaced": boolean, "mayStillRead": [name], "hadOthers": boolean }
 inline constexpr const char* kCXDEndedPublication = "CXDEndedPublication";
 std::optional<EndedPublication> endedPublication(const Preferences& preferences);
 // Writes the note and synchronises the domain.

@@ -290,6 +290,9 @@ CXDAVManager::Snapshot::~Snapshot() {
 void CXDAVManager::keepSerialNumber(const std::string& serial) {
     _impl->structure.keepSerialNumber(serial);
 }
+void CXDAVManager::mendOwnTreeOnly(bool mendOnly) {
+    _impl->structure.mendOnly(mendOnly);
+}
 bool CXDAVManager::sanityCheckPublishStructureCreate(bool create) {
     return !account().user.empty() && _impl->structure.check(create);
 }

@@ -79,6 +79,7 @@ bool PublishStructure::checkNow(bool create) {
     // Something is missing: it may be more than the first look showed.
     if (!missing.tree && !missing.people) missing = look(true);
     if (!missing.known) return false;
+    if (_mendOnly && missing.info && missing.people) return false;
     if (!complete(missing)) {
         // Perhaps because somebody else is making it, too: servers answer variously to one of two at the same time.
         const Missing left = look(true);

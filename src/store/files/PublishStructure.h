@@ -23,6 +23,9 @@ public:
     // What a lost "info" is to say again; "" for a new number. A tree that is made anew under its old number is filled
     // by its owner, and nobody takes it for another tree.
     void keepSerialNumber(std::string serial);
+    // True: a tree of which neither "info" nor "People" is left has been withdrawn by another computer of its owner,
+    // and is not made anew.
+    void mendOnly(bool mendOnly) { _mendOnly = mendOnly; }
 
 private:
     struct Missing {
@@ -46,7 +49,7 @@ private:
     StoreFiles& _files;
     std::mutex _mutex; // one completion at a time; guards the following
     std::string _serial;
-    std::atomic<bool> _doubtful{false}, _isKnown{false};
+    std::atomic<bool> _doubtful{false}, _isKnown{false}, _mendOnly{false};
 };
 
 } // namespace rolvane
