@@ -5,11 +5,13 @@
 #include "Subscriptions.h"
 #include "ValueNames.h"
 
+#include "conduits/store/ComputersOnStore.h"
 #include "contacts/database/DaemonMemory.h"
 #include "contacts/database/WithdrawnContacts.h"
 #include "contacts/records/RecordKind.h"
 #include "foundation/Paths.h"
 #include "foundation/Preferences.h"
+#include "model/Computers.h"
 #include "server/BooksDevices.h"
 #include "server/PrivateStore.h"
 
@@ -109,6 +111,15 @@ std::vector<Offer> conflicts() {
     return all;
 }
 
+std::vector<Offer> computers() {
+    std::vector<Offer> all;
+    const Preferences& preferences = Preferences::shared();
+    const std::string self = preferences.get(kDaemonDomain, kCXDComputer).dictionary()["id"].string();
+    for (const Computer& each : computersOfValue(preferences.get(kDaemonDomain, kCXDComputers)))
+        if (each.id != self) all.push_back({each.name, each.seen ? "last there " + each.seen->toISO8601() : ""});
+    return all;
+}
+
 std::vector<Offer> keys(const CompletionPoint& point) {
     return offersOf(Preferences::shared().keys(givenOr(point, "domain", "net.rolvane.RolvaneManager")));
 }
@@ -133,6 +144,7 @@ std::vector<Offer> valuesOf(const std::string& kind, const CompletionPoint& poin
     if (kind == kDeviceValue) return devices(point);
     if (kind == kWithdrawnValue) return withdrawn();
     if (kind == kConflictValue) return conflicts();
+    if (kind == kComputerValue) return computers();
     if (kind == kKeyValue) return keys(point);
     return {};
 }

@@ -1,4 +1,5 @@
 #include "Books.h"
+#include "Computers.h"
 #include "Conflicts.h"
 #include "Context.h"
 #include "Counted.h"
@@ -6,12 +7,13 @@
 #include "LeftOnStore.h"
 #include "PassReport.h"
 #include "PassWatch.h"
-#include "SafeText.h"
 #include "Publication.h"
+#include "SafeText.h"
 #include "Subscriptions.h"
 #include "Texts.h"
 #include "Withdrawn.h"
 
+#include "conduits/store/ComputersOnStore.h"
 #include "conduits/store/EndedPublication.h"
 #include "daemon/DaemonControl.h"
 #include "engine/memory/EngineState.h"
@@ -149,7 +151,9 @@ Json endedJson(const Preferences& preferences, bool publishes) {
     Json users = Json::array();
     for (const UserName& user : ended->mayStillRead) users.push_back(user.str());
     return {{"date", ended->when.toISO8601()},
-            {"why", ended->replaced ? "replaced" : "goneOrForbidden"},
+            {"why", ended->hadOthers  ? "withdrawnElsewhere"
+                    : ended->replaced ? "replaced"
+                                      : "goneOrForbidden"},
             {"mayStillRead", users}};
 }
 
@@ -157,7 +161,10 @@ std::string endedText(const Json& ended) {
     std::string users;
     for (const Json& user : ended["mayStillRead"]) users += (users.empty() ? "" : ", ") + user.get<std::string>();
     return tr("on {}: {}. `rolvane publish` publishes again.{}", shownDate(ended["date"].get<std::string>()),
-              ended["why"] == "replaced"
+              ended["why"] == "withdrawnElsewhere"
+                  ? "another computer of yours has taken it off the store, or has published it anew; `rolvane join` "
+                    "keeps this one in step with a new one"
+              : ended["why"] == "replaced"
                   ? translated("another publication of yours lies in its place on the store, made from another "
                                "computer perhaps")
                   : translated("the store has nothing of it any more, or does not let you in"),
@@ -193,6 +200,7 @@ Json status(Context& context) {
             {"daemon", pid ? Json(*pid) : Json()},
             {"store", storeStatus()},
             {"published", {{"everything", publication.everything()}, {"groups", groups}}},
+            {"computers", computersJson(preferences, computersOfValue(preferences.get(kDaemonDomain, kCXDComputers)))},
             {"publicationEnded", endedJson(preferences, publication.anything())},
             {"leftOnStore", anythingLeftOnStore(database, preferences)},
             {"subscriptions", subscriptions},
@@ -240,6 +248,12 @@ std::string inStepText(const Json& tree) {
            (since.empty() ? "" : tr(", what came after that waits since {}", since));
 }
 
+std::string computerRow(const Json& computer) {
+    return computer["name"].get<std::string>() + (computer["thisComputer"].get<bool>() ? " (this one)" : "") +
+           (computer["lastThere"].is_null() ? ""
+                                            : ", last there " + shownDate(computer["lastThere"].get<std::string>()));
+}
+
 void showStatus(Context& context) {
     const Json s = status(context);
     if (!s["damaged"].is_null()) context.exitCode = kFailed;
@@ -264,6 +278,10 @@ void showStatus(Context& context) {
         if (!store["reachable"].get<bool>()) row("", store["toDo"].get<std::string>());
     }
     row(translated("Published"), publishedText(s["published"]));
+    if (s["computers"].size() > 1) {
+        std::string label = "Computers";
+        for (const Json& computer : s["computers"]) row(std::exchange(label, ""), computerRow(computer));
+    }
     if (!s["publicationEnded"].is_null()) row("", tr("ended {}", endedText(s["publicationEnded"])));
     if (s["leftOnStore"])
         row("", translated("files of what was withdrawn are still on the store; the same `rolvane unpublish` again "

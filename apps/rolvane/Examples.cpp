@@ -64,10 +64,12 @@ const std::map<std::string, const char*>& examples() {
                  "  rolvane plan --json"},
         {"publish", "  rolvane publish\n"
                     "  rolvane publish --dry-run\n"
-                    "  rolvane publish --group Family"},
+                    "  rolvane publish --group Family\n"
+                    "  rolvane publish --replace"},
         {"unpublish", "  rolvane unpublish --group Family\n"
                       "  rolvane unpublish --keep\n"
-                      "  rolvane unpublish --yes --forget-shares"},
+                      "  rolvane unpublish --yes --forget-shares\n"
+                      "  rolvane unpublish --all-computers"},
         {"share", "  rolvane share bob\n"
                   "  rolvane share carol --write"},
         {"unshare", "  rolvane unshare bob"},
@@ -83,6 +85,12 @@ const std::map<std::string, const char*>& examples() {
         {"subscribe", "  rolvane subscribe bob\n"
                       "  rolvane subscribe http://dav.example.org/bob/Contacts --no-wait"},
         {"unsubscribe", "  rolvane unsubscribe bob"},
+        {"join", "  rolvane join --dry-run\n"
+                 "  rolvane join --yes"},
+        {"computers", "  rolvane computers\n"
+                      "  rolvane computers --name laptop"},
+        {"leave", "  rolvane leave\n"
+                  "  rolvane leave --computer \"old laptop\""},
         {"subscriptions", "  rolvane subscriptions\n"
                           "  rolvane subscriptions --json"},
         {"group list", "  rolvane group list --of bob"},

@@ -2,13 +2,16 @@
 
 #include "Shares.h"
 
+#include "conduits/TakingIn.h"
 #include "conduits/store/EndedPublication.h"
+#include "conduits/store/StoreComparison.h"
 #include "contacts/records/Constants.h"
 #include "contacts/records/Identifier.h"
 #include "contacts/records/SharingDates.h"
 #include "engine/memory/EngineState.h"
 #include "engine/memory/PublicationCache.h"
 #include "engine/queue/RefusedChanges.h"
+#include "model/Computers.h"
 #include "model/RemoteLocationMap.h"
 
 #include <algorithm>
@@ -123,9 +126,13 @@ std::vector<UniqueId> Publication::peopleOnlyIn(const CXGroupRef& group) const {
 
 void forgetPublication(Preferences& preferences) {
     EngineState state(preferences);
+    const Value serial =
+        state.conduitObjectForKey(kConduitVaultra, "priorState")[kSelf.str()].dictionary()[kSerialNumber];
+    if (serial.isString()) preferences.set(kDaemonDomain, kCXDFormerTree, serial);
     for (const char* conduit : {kConduitCX, kConduitVaultra})
         state.conduitObjectForKey(conduit, "priorState").remove(kSelf.str());
     state.withConduitData([](Dictionary& data) { forgetRefusedChanges(data); });
+    state.setConduitObjectForKey(kConduitCX, Dictionary(), kTakingIn);
     state.noteRefusedByOwnStore(0, std::nullopt);
     for (const char* note : {kCXDUnsavedAccessLists, kCXDUnderWay, kCXDEndedPublication})
         preferences.remove(kDaemonDomain, note);

@@ -1,8 +1,10 @@
 #include "PublishedAlready.h"
 
+#include "Computers.h"
 #include "Texts.h"
 
 #include "conduits/PublishedLayout.h"
+#include "conduits/store/ComputersOnStore.h"
 #include "conduits/store/StoreComparison.h"
 #include "engine/memory/EngineState.h"
 #include "engine/memory/StateRows.h"
@@ -53,7 +55,8 @@ PublishedAlready publishedAlready(CXDAVManager& store, const Preferences& prefer
     const std::string known = knownSerial(preferences);
     const bool isOurs = known.empty() ? publishesHere && lastOutcome(preferences) : serial == known;
     return {isOurs ? PublishedAlready::By::thisComputer : PublishedAlready::By::another,
-            store.modDateForURL(base.cxURLByAppendingComponent(layout::kDateFile))};
+            store.modDateForURL(base.cxURLByAppendingComponent(layout::kDateFile)),
+            ComputersOnStore(store, base).read().value_or(std::vector<Computer>())};
 }
 
 std::string publishedAlreadyText(const PublishedAlready& found) {
@@ -64,9 +67,9 @@ std::string publishedAlreadyText(const PublishedAlready& found) {
         return fmt::format("Contacts of this account are published, from this computer{}.", when);
     case PublishedAlready::By::another: break;
     }
-    return fmt::format("Contacts of this account are published already, from another computer or another database{}. "
-                       "The store does not tell which one. Publish from one of them only.",
-                       when);
+    return fmt::format("Contacts of this account are published already, from another computer or another database{}{}. "
+                       "`rolvane join` brings them here and keeps both in step.",
+                       found.computers.empty() ? "" : ": " + computersText(found.computers), when);
 }
 
 nlohmann::ordered_json publishedAlreadyJson(const PublishedAlready& found) {

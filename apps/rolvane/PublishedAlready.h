@@ -4,19 +4,22 @@
 
 #include "foundation/Date.h"
 #include "foundation/Preferences.h"
+#include "model/Computers.h"
 #include "store/dav/CXDAVManager.h"
 
 #include <optional>
 #include <string>
+#include <vector>
 
 namespace rolvane::cli {
 
-// Whether contacts of an account are on its store already, and who put them there. A store tells no computers' names: a
-// tree is this computer's when it bears the serial number that this database knows it by.
+// Whether contacts of an account are on its store already, and who put them there. A tree is this computer's when it
+// bears the serial number that this database knows it by. It names computers that have told of themselves.
 struct PublishedAlready {
     enum class By { nobody, thisComputer, another };
     By by = By::nobody;
     std::optional<Date> lastWrite; // by the store's clock
+    std::vector<Computer> computers = {};
 };
 
 // Asks the account's store, which can be reached. Some requests; waits. The daemon learns the serial number when it

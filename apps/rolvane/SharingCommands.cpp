@@ -1,3 +1,4 @@
+#include "Computers.h"
 #include "Consent.h"
 #include "Context.h"
 #include "FailureText.h"
@@ -22,7 +23,8 @@ namespace {
 
 struct PublishOptions {
     std::string group;
-    bool noWait = false, noDaemon = false, keep = false, forgetShares = false, yes = false, dryRun = false;
+    bool noWait = false, noDaemon = false, keep = false, forgetShares = false, yes = false, dryRun = false,
+         replace = false, allComputers = false;
     double timeout = kPassSeconds;
 };
 
@@ -131,6 +133,7 @@ void publish(Context& context, const PublishOptions& options) {
             throw CommandError(kRefused, text.what + " " + text.toDo + " Nothing was published.");
     } else if (!served) {
         requireUsableStore("Nothing was published.");
+        if (!options.replace) requireOwnTree(CXDAVManager::defaultManager(), Preferences::shared());
     }
     askAboutReaders(context, options, group, base);
     removeWhatIsLeft(database, base);
@@ -155,6 +158,7 @@ void publish(Context& context, const PublishOptions& options) {
     // A pass that the restart ended in the middle may have left a lock or a record behind.
     if (mayGoBetter(outcome)) outcome = makePass(context, options.timeout);
     report(context, outcome, "Everything is on the store.", true);
+    if (!group && isComplete(outcome)) noteThisComputer(CXDAVManager::defaultManager(), Preferences::shared());
     if (context.json) context.print(outcomeJson(outcome));
 }
 
@@ -241,10 +245,16 @@ void askAboutWithdrawal(Context& context, const PublishOptions& options, const C
 
 void unpublish(Context& context, const PublishOptions& options) {
     ownBase(); // there is an account
+    Preferences& preferences = Preferences::shared();
+    if (!options.allComputers && Publication(context.database()).everything())
+        requireNoOtherComputer(CXDAVManager::defaultManager(), preferences);
     const CXGroupRef group = options.group.empty() ? nullptr : findGroup(context.database(), options.group);
     if (options.dryRun) return tellWithdrawal(context, options, group);
     askAboutWithdrawal(context, options, group);
-    whileDaemonRests([&] { unpublishAtRest(context, options, group); }); // nothing is written behind our back
+    whileDaemonRests([&] {
+        unpublishAtRest(context, options, group);
+        if (isOneOfSeveral(preferences)) becomeTheOnlyOne(preferences);
+    }); // nothing is written behind our back
 }
 
 } // namespace
@@ -256,6 +266,8 @@ void addSharingCommands(CLI::App& app, Context& context) {
         [&](CLI::App& command) {
             command.add_option("-g,--group", options->group, "Publish this group only (name or identifier)")
                 ->type_name(kGroupValue);
+            command.add_flag("--replace", options->replace,
+                             "Publish over what another computer of yours has published");
             declareConsent(command, options->yes);
             declareTrial(command, options->dryRun);
             command.add_flag("--no-wait", options->noWait, "Return as soon as the daemon is at work");
@@ -274,6 +286,8 @@ void addSharingCommands(CLI::App& app, Context& context) {
             command.add_flag("--forget-shares", options->forgetShares,
                              "Forget with whom you share, too, when nothing stays published; without it, the next "
                              "publication is shared with the same users");
+            command.add_flag("--all-computers", options->allComputers,
+                             "Also where other computers of yours keep them in step");
             declareConsent(command, options->yes);
             declareTrial(command, options->dryRun);
         },

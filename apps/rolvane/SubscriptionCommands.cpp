@@ -157,9 +157,10 @@ void subscribe(Context& context, const SubscribeOptions& options) {
     const RemoteLocation location = namedLocation(options.named);
     const std::string user = publisherOf(location), self = CXDAVManager::vaultraUser();
     if (userForRemoteLocation(location, UserName(self), {}) == kSelf)
-        throw CommandError(kRefused, fmt::format("\"{}\" is your own account; its contacts are here already. To share "
-                                                 "them with others, use `rolvane publish`.",
-                                                 user));
+        throw CommandError(kRefused,
+                           fmt::format("\"{}\" is your own account. `rolvane join` brings what another computer "
+                                       "has published of it; `rolvane publish` shares what is here.",
+                                       user));
     CXRolvane& database = context.database();
     if (database.findSubscriptionWithRemoteLocation(location))
         throw CommandError(kRefused, fmt::format("You are subscribed to \"{}\" already. `rolvane sync` brings what is "

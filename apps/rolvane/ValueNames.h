@@ -16,6 +16,7 @@ inline constexpr const char* kStoreUserValue = "STORE-USER"; // of the private s
 inline constexpr const char* kDeviceValue = "DEVICE";        // of the address books that --directory names
 inline constexpr const char* kWithdrawnValue = "WITHDRAWN";  // contacts that a publisher no longer shares
 inline constexpr const char* kConflictValue = "CONFLICT";    // the number of one
+inline constexpr const char* kComputerValue = "COMPUTER";    // another one that keeps the own contacts in step
 inline constexpr const char* kKeyValue = "KEY";              // of the preferences that --domain names
 
 } // namespace rolvane::cli

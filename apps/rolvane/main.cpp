@@ -1,6 +1,7 @@
 #include "BackupCommands.h"
 #include "CompleteCommand.h"
 #include "Completion.h"
+#include "Computers.h"
 #include "Context.h"
 #include "HelpCommand.h"
 #include "LogCommands.h"
@@ -109,6 +110,7 @@ int main(int argc, char** argv) {
     addSharingCommands(app, context);
     addShareCommands(app, context);
     addSubscriptionCommands(app, context);
+    addComputerCommands(app, context);
     addWithdrawnCommands(app, context);
     addConflictCommands(app, context);
     addDaemonCommands(app, context);

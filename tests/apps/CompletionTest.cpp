@@ -175,7 +175,7 @@ TEST_F(Completion, OnlyWhatBeginsWithTheWordIsOffered) {
     EXPECT_EQ(offered({"export", "--gr"}), Names{"--group"});
     EXPECT_EQ(offered({"no-such-command", ""}), Names{});
     EXPECT_EQ(offered({"books", "merge"}), Names{}) << "a command that is not shown";
-    EXPECT_EQ(offered({"comp"}), Names{});
+    EXPECT_EQ(offered({"comple"}), Names{});
 }
 
 TEST_F(Completion, NothingIsMadeAndNothingIsSaidWhereThereIsNothing) {

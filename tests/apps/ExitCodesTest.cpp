@@ -104,6 +104,9 @@ const std::vector<Row> kRows{
     {"unsubscribe bob --yes", 3, 3, 3},
     {"preview bob", 3, 3, 3},
     {"sync", 0, 6, 5}, // there is nothing to be sent where nothing is shared
+    {"join --yes", 3, 6, 5},
+    {"computers", 3, 0, 0},
+    {"leave --yes", 3, 5, 5},
     {"unpublish --yes", 3, 6, 5},
     {"new-database --yes", 1, 1, 1},
 };

@@ -184,7 +184,7 @@ TEST_F(Subscribing, UnsubscribingTakesTheCopiesAwayAndNothingFromThePublisher) {
     bob.done({"subscribe", "alice"});
     ASSERT_EQ(bob.json({"subscriptions"})[0]["writable"], true);
     const auto before = contents();
-    ASSERT_EQ(before.size(), 5U);
+    ASSERT_EQ(before.size(), 6U);
     const auto ended = bob.json({"unsubscribe", "alice"});
     EXPECT_EQ(ended["people"], 2);
     EXPECT_TRUE(nothingIsNoted());

@@ -73,7 +73,7 @@ TEST_F(Withdrawing, ThatFailsInTheMiddleIsFinishedByTheNextPublication) {
     EXPECT_EQ(world.json({"status"})["published"]["everything"], false);
     storeWorksAgain();
     world.done({"publish"});
-    EXPECT_EQ(world.namedTree(), (Names{"AllCXGroup", "People/Bob", "People/Cid", "dateFile", "info"}));
+    EXPECT_EQ(world.namedTree(), (Names{"AllCXGroup", "People/Bob", "People/Cid", "computers", "dateFile", "info"}));
     EXPECT_FALSE(anythingLeft());
     EXPECT_EQ(world.json({"list"}).size(), 2U) << "the contacts stay";
 }
@@ -158,7 +158,7 @@ TEST_F(Withdrawing, ThatWasKilledBeforeItTookAnythingAwayIsFinished) {
     EXPECT_TRUE(anythingLeft());
     world.done({"delete", "--yes", "Ada"});
     world.done({"publish"});
-    EXPECT_EQ(world.namedTree(), (Names{"AllCXGroup", "People/Bob", "People/Cid", "dateFile", "info"}));
+    EXPECT_EQ(world.namedTree(), (Names{"AllCXGroup", "People/Bob", "People/Cid", "computers", "dateFile", "info"}));
     EXPECT_FALSE(anythingLeft());
 }
 
