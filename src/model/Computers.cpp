@@ -43,8 +43,10 @@ void becomeTheOnlyOne(Preferences& preferences) {
 
 Computer thisComputer(Preferences& preferences) {
     Dictionary known = preferences.get(kDaemonDomain, kCXDComputer).dictionary();
-    if (known[kId].string().empty() || known[kMachine].string() != machine()) {
-        known = Dictionary{{kId, makeUUID()}, {kMachine, machine()}};
+    const std::string before = known[kMachine].string(), now = machine();
+    // A program that may not read the machine's identifier is still on the same machine.
+    if (known[kId].string().empty() || (!now.empty() && !before.empty() && before != now)) {
+        known = Dictionary{{kId, makeUUID()}, {kMachine, now}};
         preferences.set(kDaemonDomain, kCXDComputer, known);
         preferences.synchronize(kDaemonDomain);
     }
