@@ -30,12 +30,13 @@ constexpr LogKind kWatches{"watches", "bbeeb6361d334c6d96f0da847a2a3b87", 5};
 constexpr LogKind kTold{"told", "68e58909ccb24416925a56c9a30f4300", 5};
 constexpr LogKind kConfiguration{"configuration", "ff53a46f5ead403a84c4b877678537a3", 4};
 constexpr LogKind kStore{"store", "e179f773a6e043c09514b7dde2ad0478", 4};
+constexpr LogKind kComputers{"computers", "e93e466011e14cb0a891d292da65fbcc", 6};
 constexpr LogKind kProgress{"progress", "0c28cec1b94742afa4b936976b4b76b0", 7};
 
 constexpr std::array kKinds{&kEnded,         &kAlreadyRunning, &kPassFailed,    &kChangeFailed, &kStrangeContent,
                             &kTreeDamaged,   &kSharingEnded,   &kRightsNotSet,  &kLock,         &kDatabase,
                             &kGoneElsewhere, &kMemoryNotKept,  &kNotifications, &kWatches,      &kTold,
-                            &kConfiguration, &kStore,          &kProgress};
+                            &kConfiguration, &kStore,          &kComputers,     &kProgress};
 
 // A line of the log, its kind, and for each placeholder whether its argument may be shown to everybody ('-'), has to be
 // cleared of names first ('t', see withoutNames), or is a name or a content itself ('n').
@@ -92,6 +93,10 @@ constexpr Line kLines[] = {
      &kSharingEnded, "nt"},
     {"The contact database is damaged: %@", &kDatabase, "t"},
     {"The counters could not be written: %@", &kMemoryNotKept, "t"},
+    {"Another computer keeps this publication in step, too.", &kComputers, ""},
+    {"The tree of this account has been taken in.", &kComputers, ""},
+    {"The tree of this account has no list of its contacts, and is not taken in before it has one again.",
+     &kTreeDamaged, ""},
     {"The damage of the contact database could not be noted: %@", &kDatabase, "t"},
     {"The directory %@ cannot be watched (%@): the database is looked at every second instead. Raise "
      "fs.inotify.max_user_instances or fs.inotify.max_user_watches.",
