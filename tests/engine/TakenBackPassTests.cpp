@@ -4,6 +4,7 @@
 #include "TwoUsers.h"
 #include "Writes.h"
 #include "foundation/CXException.h"
+#include "model/PayloadKeys.h"
 
 namespace rolvane::test {
 
@@ -79,6 +80,28 @@ protected:
     }
     CXRecordRef copyOf(const CXRecordRef& record, std::string_view table) {
         return bob.application->recordForUniqueId(cxUIDWithTableName(record->uniqueId(), table));
+    }
+    void refuseFileOf(const UniqueId& record) {
+        bob.wire->intercept([part = record.str().substr(0, 36)](const HttpRequest& request) {
+            const bool isIt = request.method == "PUT" && request.url.encodedPath().find(part) != std::string::npos;
+            return isIt ? std::optional(answerOf(500)) : std::nullopt;
+        });
+    }
+    // Bob's list of everybody names the record, the store refuses its file, and a week goes by.
+    void leaveHalf(const UniqueId& record) {
+        refuseFileOf(record);
+        bob.pass();
+        bob.wire->intercept({});
+        const auto isListed = [&] {
+            const Dictionary list = contentOf(world->file("AllCXGroup"));
+            const char* kind = record.endsWith(kCXGroupTable) ? kSubgroupUIDState : kMemberUIDState;
+            return list[kind].array().containsString(record.str());
+        };
+        ASSERT_TRUE(isListed()) << log.text();
+        alice.pass();
+        alice.clock.ahead = bob.clock.ahead = 8.0 * 86400;
+        for (int round = 0; isListed() && round < 2; ++round) alice.pass();
+        ASSERT_FALSE(isListed()) << log.text();
     }
     bool isOnTheStore(const UniqueId& person) { return std::filesystem::exists(fileOf(cxNormalizedUID(person))); }
 
@@ -451,6 +474,55 @@ TEST_F(TakenBackPass, AContactThatItsOwnerHasTakenForALeftoverIsWrittenAgain) {
     settle();
     EXPECT_TRUE(isOnTheStore(dora)) << log.text();
     EXPECT_EQ(alice.countPeople(), 4u);
+}
+
+// Its file had come all the same, and the answer got lost.
+TEST_F(TakenBackPass, ANewGroupThatItsOwnerDeletesWithinTheWeekStaysDeleted) {
+    const UniqueId shared = cxNormalizedUID(groupInAlices("Circle")->uniqueId());
+    refuseFileOf(shared);
+    bob.pass();
+    bob.wire->intercept({});
+    rewrite(world->file(shared.str()),
+            PropertyList::toXML(Dictionary{
+                {kMemberUIDState, Array()}, {kSubgroupUIDState, Array()}, {kCXGroupNameProperty, "Circle"}}));
+    alice.pass();
+    const CXRecordRef taken = alice.application->recordForUniqueId(shared);
+    ASSERT_TRUE(taken) << log.text();
+    remove(alice, taken);
+    settle();
+    EXPECT_FALSE(alice.application->recordForUniqueId(shared)) << log.text();
+    EXPECT_FALSE(std::filesystem::exists(world->file(shared.str())));
+}
+
+// Its name stood in the list for a week, its file never came, and the owner's daemon has taken the name out.
+TEST_F(TakenBackPass, ANewContactWhoseNameItsOwnerHasTakenForALeftoverIsWrittenAgain) {
+    const CXPersonRef dora = addToAlices("Dora");
+    const auto copy = std::dynamic_pointer_cast<CXGroup>(copyOf(friends, kCXSubscribedGroupTable));
+    copy->addMember(dora);
+    bob.application->save();
+    const UniqueId shared = cxNormalizedUID(dora->uniqueId());
+    leaveHalf(shared);
+    settle();
+    EXPECT_TRUE(isOnTheStore(shared)) << log.text();
+    EXPECT_EQ(alice.countPeople(), 4u);
+    EXPECT_EQ(friends->memberUniqueIds().size(), 3u);
+    EXPECT_TRUE(bob.application->recordForUniqueId(dora->uniqueId()));
+}
+
+TEST_F(TakenBackPass, ANewGroupWhoseNameItsOwnerHasTakenForALeftoverIsWrittenAgain) {
+    const CXGroupRef circle = groupInAlices("Circle");
+    circle->addMember(bob.copyOf(people[1]));
+    const auto outer = std::dynamic_pointer_cast<CXGroup>(copyOf(friends, kCXSubscribedGroupTable));
+    outer->addSubgroup(circle);
+    bob.application->save();
+    const UniqueId shared = cxNormalizedUID(circle->uniqueId());
+    leaveHalf(shared);
+    settle();
+    const auto here = std::dynamic_pointer_cast<CXGroup>(alice.application->recordForUniqueId(shared));
+    ASSERT_TRUE(here) << log.text();
+    EXPECT_EQ(here->name(), "Circle");
+    EXPECT_EQ(here->memberUniqueIds(), std::vector{people[1]->uniqueId()});
+    EXPECT_EQ(friends->subgroupUniqueIds(), std::vector{shared});
 }
 
 } // namespace rolvane::test

@@ -31,6 +31,9 @@ class UserAlert;
 using ACLManagerFactory =
     std::function<std::shared_ptr<CXACLManager>(const Url& baseLocation, const LocationOwner& owner)>;
 
+// A contact or group of the user's tree, as the database names it: the owner's own, or a copy.
+UniqueId nameInDatabase(const UserName& user, const UniqueId& shared);
+
 // The conduit of the network store: applies change records to the tree of the record's user on the WebDAV store, and
 // knows whether the store can be used at all.
 //
@@ -159,6 +162,8 @@ private:
     bool somebodyMayWrite(); // besides the owner
     bool allGroupHas(const char* property);
     void compareUnlistedGroups(CXDChangeRecords& records);
+    void nameAgain(CXDChangeRecords& records);
+    bool wasNeverThere(const UserName& user, const UniqueId& name);
     void compareWhatHadCome(CXDChangeRecords& records);
     std::vector<CXReached> whatHadCome();
     void forgetWhatIsKnown();

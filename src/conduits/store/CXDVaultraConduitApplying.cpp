@@ -23,17 +23,11 @@ constexpr int kOk = 200;
 constexpr int kForbidden = 403;
 constexpr int kMissing = 404;
 
-UniqueId groupInDatabase(const UserName& user, const UniqueId& group) {
-    return cxUIDWithTableName(group, user == kSelf ? kCXGroupTable : kCXSubscribedGroupTable);
-}
-
 // The contacts and groups that two lists of a group's change name, as the database names them.
 std::vector<UniqueId> namedIn(const UserName& user, const Dictionary& payload, const char* people, const char* groups) {
     std::vector<UniqueId> named;
-    for (const Value& name : payload[people].array())
-        named.push_back(
-            cxUIDWithTableName(UniqueId(name.string()), user == kSelf ? kCXPersonTable : kCXSubscribedPersonTable));
-    for (const Value& name : payload[groups].array()) named.push_back(groupInDatabase(user, UniqueId(name.string())));
+    for (const char* list : {people, groups})
+        for (const Value& name : payload[list].array()) named.push_back(nameInDatabase(user, UniqueId(name.string())));
     return named;
 }
 
@@ -44,6 +38,12 @@ Dictionary contentOf(CXDChangeRecord& record) {
 }
 
 } // namespace
+
+UniqueId nameInDatabase(const UserName& user, const UniqueId& shared) {
+    const bool isPerson = shared.endsWith("Person");
+    if (user == kSelf) return cxUIDWithTableName(shared, isPerson ? kCXPersonTable : kCXGroupTable);
+    return cxUIDWithTableName(shared, isPerson ? kCXSubscribedPersonTable : kCXSubscribedGroupTable);
+}
 
 bool CXDVaultraConduit::lockStructureForRecord(const CXDChangeRecord& record) {
     awaitStructure();
@@ -139,7 +139,7 @@ void CXDVaultraConduit::noteNewRecords(const CXDChangeRecords& records) {
             _newRecords.insert(inDatabase(*record));
         if (record->group() && !users[record->user()->str()].dictionary().contains(
                                    cxUIDWithTableName(*record->group(), kCXGroupTable).str()))
-            _newRecords.insert(groupInDatabase(*record->user(), *record->group()));
+            _newRecords.insert(nameInDatabase(*record->user(), *record->group()));
     }
 }
 
@@ -198,7 +198,7 @@ bool CXDVaultraConduit::createStructureForGroup(CXDChangeRecord& record, int& co
     const auto base = baseLocationOf(record);
     if (!base || !record.group()) return false;
     const UserName user = record.user().value_or(UserName());
-    const UniqueId here = groupInDatabase(user, *record.group());
+    const UniqueId here = nameInDatabase(user, *record.group());
     if (_inDoubt.contains(here)) return false;
     // Whether the directory could be made shows in the write below it.
     _world.manager.createDirectoryAtAURL(layout::groupLocation(*base, *record.group()));
@@ -218,7 +218,7 @@ bool CXDVaultraConduit::makeCompositeGroupChange(CXDChangeRecord& record, int& c
     const auto waits = [&](const UniqueId& uid) {
         return _inDoubt.contains(uid) || (!isList && _newOnStore.waitsForList(uid));
     };
-    const UniqueId here = groupInDatabase(*record.user(), *record.group());
+    const UniqueId here = nameInDatabase(*record.user(), *record.group());
     if (!waits(here) && std::none_of(named.begin(), named.end(), waits)) {
         if (isList) _newOnStore.willName(*record.user(), named, _world.clock.now());
         if (writeComposite(record, payload, code)) {
@@ -317,7 +317,7 @@ bool CXDVaultraConduit::deleteRecord(CXDChangeRecord& record, int& code) {
 bool CXDVaultraConduit::deleteGroup(CXDChangeRecord& record, int& code) {
     const auto base = baseLocationOf(record);
     if (!base || !record.group()) return false;
-    if (_newOnStore.waitsForList(groupInDatabase(record.user().value_or(UserName()), *record.group()))) return false;
+    if (_newOnStore.waitsForList(nameInDatabase(record.user().value_or(UserName()), *record.group()))) return false;
     return _world.manager.removeFileAtURL(layout::groupLocation(*base, *record.group()), &code);
 }
 

@@ -15,6 +15,7 @@
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
 #include "foundation/Preferences.h"
+#include "foundation/TestSwitch.h"
 #include "model/PayloadKeys.h"
 #include "model/RemoteLocationMap.h"
 
@@ -234,6 +235,7 @@ CXDChangeRecords CXDVaultraConduit::changeRecords() {
     for (const CXDChangeRecordPtr& record : records)
         if (record->user()) changed.insert(*record->user());
     leaveUnlistedOut(records);
+    nameAgain(records);
     compareUnlistedGroups(records);
     compareWhatHadCome(records);
     for (const CXDChangeRecords* some : {&records, &_leftovers})
@@ -256,7 +258,7 @@ void CXDVaultraConduit::compareUnlistedGroups(CXDChangeRecords& records) {
     for (const auto& [user, state] : _read) {
         const Dictionary prior = users[user.str()].dictionary();
         const auto isHere = [&, &user = user](const UniqueId& group) {
-            const UniqueId uid = cxUIDWithTableName(group, user == kSelf ? kCXGroupTable : kCXSubscribedGroupTable);
+            const UniqueId uid = nameInDatabase(user, group);
             if (_world.rolvane.recordForUniqueId(uid)) return true;
             absences.requireGone(uid);
             return false;
@@ -297,6 +299,61 @@ void CXDVaultraConduit::compareWhatHadCome(CXDChangeRecords& records) {
             records.push_back(std::move(removal));
         }
     }
+}
+
+// A name may come into the list of everybody before its file. When the file does not follow within a week, the owner's
+// daemon takes the name for a leftover and removes it from all lists. Nobody ever had such a record, so it was not
+// deleted: its maker's daemon, which still has the file to write, writes the names again.
+void CXDVaultraConduit::nameAgain(CXDChangeRecords& records) {
+    if (isLeftOut("named again")) return;
+    const auto isRemoval = [](const CXDChangeRecord& record) {
+        return (record.type() == CXDRemoveRecordFromGroup || record.type() == CXDRemoveGroupFromGroup) &&
+               record.user() && record.person() && record.group();
+    };
+    std::set<std::pair<UserName, UniqueId>> taken;
+    for (const CXDChangeRecordPtr& record : records)
+        if (isRemoval(*record) && record->group()->str() == layout::kAllGroup &&
+            wasNeverThere(*record->user(), *record->person()))
+            taken.emplace(*record->user(), *record->person());
+    if (taken.empty()) return;
+    CXDChangeRecords choices;
+    for (CXDChangeRecordPtr& record : records) {
+        if (!isRemoval(*record) || !taken.contains({*record->user(), *record->person()})) continue;
+        const auto again = [&](CXDChangeType type, const Value& payload = {}) {
+            auto change = std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, type, record->user(), record->person(),
+                                                            record->group(), payload);
+            change->setAppliesToSources(conduitSource());
+            return change;
+        };
+        const bool isGroup = record->type() == CXDRemoveGroupFromGroup;
+        Dictionary known = engine()
+                               .conduitObjectForKey(kConduitVaultra, kPriorState)
+                               .dictionaryFor(record->user()->str())
+                               .dictionaryFor(cxUIDWithTableName(*record->group(), kCXGroupTable).str());
+        known.arrayFor(isGroup ? kSubgroupUIDState : kMemberUIDState).removeAll(*record->person());
+        if (const Value& choice = known[kDistributionListState].dictionary()[record->person()->str()])
+            choices.push_back(again(CXDUpdateDistributionList, choice));
+        CXLog("It never came to the store, and is named there again: %@", record->description());
+        record = again(isGroup ? CXDAddGroupToGroup : CXDAddRecordToGroup);
+    }
+    records.insert(records.end(), choices.begin(), choices.end());
+}
+
+// No file of the new contact or group is known to have been on the store, and a leftover's time is over for it.
+bool CXDVaultraConduit::wasNeverThere(const UserName& user, const UniqueId& name) {
+    if (!mergesInto(user)) return false;
+    const bool isGroup = name.endsWith(kCXGroupTable);
+    const UniqueId uid = nameInDatabase(user, name);
+    const CXRecordRef record = _world.rolvane.recordForUniqueId(uid);
+    if (!record) return false;
+    const auto made = record->valueForProperty(kCXCreationDateProperty).date();
+    if (!made || _world.clock.now().secondsSince(*made) < kPatience) return false;
+    const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
+    const Dictionary prior = users[user.str()].dictionary();
+    if (isGroup) return prior[name.str()].dictionary().empty();
+    const auto base = baseLocationForUser(realUserFromUser(user));
+    return base && !prior[kPeopleState].dictionary()[kMemberUIDState].dictionary().contains(name.str()) &&
+           !_world.manager.remembersVersion(layout::contactLocation(*base, name));
 }
 
 // Without those that the states know by now, and those that a leftover's time is over for.
