@@ -379,6 +379,17 @@ TEST_F(TakenBackPass, ADeletionWaitsForTheListOfEverybody) {
     EXPECT_EQ(alice.countPeople(), 2u);
 }
 
+// The list is not written while the note of its new names cannot be stored.
+TEST_F(TakenBackPass, ADeletionWaitsForAListThatADiskWithoutSpaceHoldsUp) {
+    addToAlices("Dora");
+    remove(bob, bob.copyOf(people[1]));
+    passThatIsTakenBack(bob, "/People/");
+    EXPECT_TRUE(isOnTheStore(people[1]->uniqueId())) << log.text();
+    settle();
+    EXPECT_FALSE(isOnTheStore(people[1]->uniqueId())) << log.text();
+    EXPECT_EQ(alice.countPeople(), 3u);
+}
+
 // The pass had written file and name; the other one took the contact in, and took it away.
 TEST_F(TakenBackPass, AContactThatSomebodyElseDeletesBehindItStaysDeleted) {
     for (Participant* maker : {&alice, &bob}) {

@@ -7,6 +7,7 @@
 #include "contacts/database/CXRolvane.h"
 #include "contacts/records/Constants.h"
 #include "contacts/records/Identifier.h"
+#include "foundation/CXException.h"
 #include "foundation/Log.h"
 #include "foundation/PropertyList.h"
 #include "model/PayloadKeys.h"
@@ -219,17 +220,24 @@ bool CXDVaultraConduit::makeCompositeGroupChange(CXDChangeRecord& record, int& c
         return _inDoubt.contains(uid) || (!isList && _newOnStore.waitsForList(uid));
     };
     const UniqueId here = nameInDatabase(*record.user(), *record.group());
-    if (!waits(here) && std::none_of(named.begin(), named.end(), waits)) {
-        if (isList) _newOnStore.willName(*record.user(), named, _world.clock.now());
-        if (writeComposite(record, payload, code)) {
-            if (_newRecords.contains(here)) _newOnStore.wasPut(*record.user(), here, _world.clock.now());
-            return true;
-        }
-    }
-    if (isList) {
+    const auto leave = [&] {
+        if (!isList) return;
         _newOnStore.listWaits(named);
         _newOnStore.listWaits(namedIn(*record.user(), payload, kMemberRemoves, kSubgroupRemoves));
+    };
+    try {
+        if (!waits(here) && std::none_of(named.begin(), named.end(), waits)) {
+            if (isList) _newOnStore.willName(*record.user(), named, _world.clock.now());
+            if (writeComposite(record, payload, code)) {
+                if (_newRecords.contains(here)) _newOnStore.wasPut(*record.user(), here, _world.clock.now());
+                return true;
+            }
+        }
+    } catch (const CXException&) {
+        leave();
+        throw;
     }
+    leave();
     return false;
 }
 
