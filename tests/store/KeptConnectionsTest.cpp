@@ -65,7 +65,7 @@ struct Kept {
           }),
           transport(CurlTransportOptions()) {
         for (const auto& answer : all(transport, server, "GET", "/first", kConnections))
-            EXPECT_EQ(answer.status, 200) << answer.detail;
+            EXPECT_TRUE(answer.status == 200 && !answer.sentTwice) << answer.detail;
         EXPECT_EQ(server.connections(), kConnections);
     }
     Gate gate;
@@ -88,6 +88,7 @@ TEST(KeptConnections, ARequestThatMeetsOnlyConnectionsThatWereClosedGoesOutOnANe
         });
         const HttpResponse answer = kept.transport.perform(asking(kept.server.origin(), method));
         EXPECT_EQ(answer.status, 200) << method << ": " << answer.detail;
+        EXPECT_TRUE(answer.sentTwice);
         if (method == "PUT") {
             EXPECT_EQ(answer.body, "the body");
         }
@@ -134,6 +135,7 @@ TEST(KeptConnections, WhatANewConnectionRefusesIsNotRepeatedForEver) {
     Kept kept([](const FakeRequest&) { return closing(); });
     const HttpResponse answer = kept.transport.perform(asking(kept.server.origin(), "PUT"));
     EXPECT_EQ(answer.error, TransportError::unreachable);
+    EXPECT_TRUE(answer.sentTwice);
     int onNew = 0;
     for (const FakeRequest& r : kept.server.requests()) onNew += r.connection > kConnections;
     EXPECT_EQ(onNew, 1);

@@ -19,6 +19,11 @@ HttpResponse failed(TransportError error) {
     answer.error = error;
     return answer;
 }
+// The first one was carried out on a connection that then ended.
+HttpResponse toTheSecondSending(HttpResponse answer) {
+    answer.sentTwice = true;
+    return answer;
+}
 
 // How the answer to a request that the store has carried out comes to harm.
 struct Harm {
@@ -47,6 +52,10 @@ const std::vector<Harm> kHarms{
     {"lost by a gateway", [](const HttpResponse&) { return answerOf(502); }},
     {"too late for a gateway", [](const HttpResponse&) { return answerOf(504); }},
     {"an error after all", [](const HttpResponse&) { return answerOf(500); }},
+    {"too busy for the second sending", [](const HttpResponse&) { return toTheSecondSending(answerOf(503)); }},
+    {"a second sending that is not allowed", [](const HttpResponse&) { return toTheSecondSending(answerOf(403)); }},
+    {"no connection for the second sending",
+     [](const HttpResponse&) { return toTheSecondSending(failed(TransportError::refused)); }},
 };
 
 class LostLockAnswers : public testing::Test {

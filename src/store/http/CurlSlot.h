@@ -23,6 +23,7 @@ struct HttpJob {
     int repetitions = 0;
     bool http1Only = false;
     bool onNewConnection = false; // a kept one has failed it
+    bool wasSentTwice() const { return onNewConnection || http1Only; }
     bool metNoHandshake = false;  // the TLS handshake of a new one has failed, once
 
     HttpResponse response;

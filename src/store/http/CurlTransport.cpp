@@ -389,6 +389,7 @@ void CurlTransport::Impl::finished(CurlSlot& slot, CURLcode code) {
         return fail(std::move(job), TransportError::truncated, "The connection ended within the answer's header.");
     if (sendAgain(job)) return;
     auto done = std::move(job->done);
+    job->response.sentTwice = job->wasSentTwice();
     done(std::move(job->response));
 }
 
@@ -478,6 +479,7 @@ void CurlTransport::Impl::fail(std::unique_ptr<HttpJob> job, TransportError erro
     HttpResponse answer;
     answer.error = error;
     answer.detail = std::move(detail);
+    answer.sentTwice = job->wasSentTwice();
     if (job->headerDone) answer.headers = std::move(job->response.headers);
     job->done(std::move(answer));
 }

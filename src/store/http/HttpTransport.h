@@ -60,6 +60,9 @@ struct HttpResponse {
     std::vector<std::pair<std::string, std::string>> headers; // of the final answer, names in lower case;
                                                               // also of one whose body failed
     std::string body;
+    // A kept connection had ended behind the request, which was sent a second time. The server may have carried out the
+    // first one; this is the answer to the second, or says that none came.
+    bool sentTwice = false;
 
     bool complete() const { return error == TransportError::none; }
     bool ok() const { return complete() && status >= 200 && status < 300 && status != 207; } // what counts as success

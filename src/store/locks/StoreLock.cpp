@@ -218,7 +218,9 @@ StoreLock::Had StoreLock::attempt(CXDAVManager::Impl& client, const std::optiona
     for (int turn = 0; turn < 2; ++turn) {
         const std::string mark = makeUUID();
         const HttpResponse answer = ask({}, mark);
-        const LockAnswer said = judgeLockAnswer(answer);
+        LockAnswer said = judgeLockAnswer(answer);
+        if (answer.sentTwice && said != LockAnswer::granted && said != LockAnswer::held)
+            said = LockAnswer::unheard; // the first one may have been carried out
         const auto failed = [&](Had how) {
             client.session.noteFailure("LOCK", *_endpoint, answer);
             return how;
