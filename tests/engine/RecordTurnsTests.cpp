@@ -48,6 +48,28 @@ TEST(RecordTurns, AListOfEverybodyWaitsForContactsAndOtherGroupsForTheList) {
     EXPECT_TRUE(group);
 }
 
+// One is new, and one has waited since an earlier pass.
+TEST(RecordTurns, AGroupWaitsForEachListOfEverybodyInFrontOfIt) {
+    const CXDChangeRecords records{of("bob", CXDCompositeGroupChange, nullptr, kEverybody),
+                                   of("bob", CXDCompositeGroupChange, nullptr, kEverybody),
+                                   of("bob", CXDCompositeGroupChange, nullptr, "G:CXGroup"),
+                                   of("bob", CXDCompositeGroupChange, nullptr, kEverybody)};
+    RecordTurns turns(records, [](const UserName&) { return true; });
+    std::atomic<bool> group = false;
+    std::thread other([&] {
+        turns.await(*records[2]);
+        group = true;
+    });
+    turns.await(*records[0]);
+    turns.done(*records[0]);
+    letOthersRun();
+    EXPECT_FALSE(group);
+    turns.await(*records[1]);
+    turns.done(*records[1]);
+    other.join();
+    EXPECT_TRUE(group);
+}
+
 // Somebody who works alone takes them in the order of the list.
 TEST(RecordTurns, AGroupInFrontOfTheListWaitsForNothing) {
     const CXDChangeRecords records{of("bob", CXDCompositeGroupChange, nullptr, "G:CXGroup"),

@@ -58,7 +58,12 @@ void RecordTurns::order(const CXDChangeRecords& records, const std::function<boo
         Seen& before = seen[*record->user()];
         if (isContact(*record)) ++before.contacts;
         if (comesBehindTheList(*record)) before.other = true;
-        if (!isListOfEverybody(*record) || _trees.contains(*record->user()) || !inOrder(*record->user())) continue;
+        if (!isListOfEverybody(*record)) continue;
+        if (const auto known = _trees.find(*record->user()); known != _trees.end()) {
+            if (!before.other) ++known->second->lists; // a change that waited, and a new one
+            continue;
+        }
+        if (!inOrder(*record->user())) continue;
         Tree& tree = *_trees.emplace(*record->user(), std::make_unique<Tree>()).first->second;
         tree.contacts = before.contacts;
         tree.lists = before.other ? 0 : 1; // nobody waits for one that is behind
