@@ -6,6 +6,7 @@
 #include "contacts/database/CXRolvane.h"
 #include "contacts/database/DamagedDatabase.h"
 #include "contacts/database/DatabaseCopy.h"
+#include "contacts/database/DatabaseErrors.h"
 #include "contacts/database/RecordStore.h"
 #include "foundation/Paths.h"
 #include "foundation/PropertyList.h"
@@ -270,7 +271,7 @@ void Backup::checkDatabase() {
             const Counts counts = countsOf(workplace / kDatabase);
             _facts.people = counts.people;
             _facts.groups = counts.groups;
-            Sqlite database(workplace / kDatabase, 0);
+            Sqlite database(workplace / kDatabase, 0, throwDatabaseError);
             if (const std::string found = RecordStore(database).whatIsWrong(); !found.empty())
                 wrong("Its contact database is damaged: " + found + ".");
         }

@@ -31,8 +31,9 @@ bool exists(const std::string& path) {
     return ::stat(path.c_str(), &st) == 0;
 }
 
-bool noRoom(int code, int systemError) {
-    return (code & 0xff) == SQLITE_FULL || systemError == ENOSPC || systemError == EDQUOT || systemError == EFBIG;
+bool hadNoRoom(const SqliteFailure& failure) {
+    return (failure.code & 0xff) == SQLITE_FULL || failure.systemError == ENOSPC || failure.systemError == EDQUOT ||
+           failure.systemError == EFBIG;
 }
 
 // A reader of a read-only file leaves the journal's files read-only beside it. When the file has become writable again,
@@ -47,8 +48,9 @@ void giveJournalTheRightsOf(const std::string& path) {
 constexpr const char* kKept = "Nothing was lost: the changes are kept in memory and written with the next attempt.";
 
 // What happened to which file, and what to do: one sentence a kind of failure.
-std::string explain(const std::string& path, int code, int systemError, const std::string& detail) {
-    if (noRoom(code, systemError))
+std::string explain(const std::string& path, const SqliteFailure& failure) {
+    const auto& [code, systemError, detail, doing] = failure;
+    if (hadNoRoom(failure))
         return fmt::format("There is no room to write the preferences file \"{}\" ({}). Make room on its file system, "
                            "then try again. {}",
                            path, detail, kKept);
@@ -91,65 +93,38 @@ std::string explain(const std::string& path, int code, int systemError, const st
     throw CXException(kCXPreferencesException, std::move(reason));
 }
 
-} // namespace
-
-void PreferencesFile::StatementCloser::operator()(sqlite3_stmt* statement) const {
-    sqlite3_finalize(statement);
+[[noreturn]] void throwPreferencesError(const std::string& path, const SqliteFailure& failure) {
+    failWith(explain(path, failure));
 }
+
+} // namespace
 
 PreferencesFile::PreferencesFile(std::string path, double lockTimeoutSeconds)
     : _path(std::move(path)), _lockTimeout(lockTimeoutSeconds) {}
 
-PreferencesFile::~PreferencesFile() {
-    close();
-}
-
-void PreferencesFile::fail(int code) const {
-    if (!_db) failWith(explain(_path, code, 0, sqlite3_errstr(code)));
-    int extended = sqlite3_extended_errcode(_db);
-    bool current = (extended & 0xff) == (code & 0xff);
-    int systemError = current ? sqlite3_system_errno(_db) : 0;
-    failWith(explain(_path, code, systemError, current ? sqlite3_errmsg(_db) : sqlite3_errstr(code)));
-}
-
-bool PreferencesFile::hasMoved() const {
-    int moved = 0;
-    if (sqlite3_file_control(_db, "main", SQLITE_FCNTL_HAS_MOVED, &moved) != SQLITE_OK) return false;
-    return moved != 0;
-}
-
-void PreferencesFile::close() {
-    if (!_db) return;
-    // The journal's path may already belong to a successor of this file; it must not be taken away from it.
-    if (hasMoved()) sqlite3_db_config(_db, SQLITE_DBCONFIG_NO_CKPT_ON_CLOSE, 1, nullptr);
-    sqlite3_close_v2(_db);
-    _db = nullptr;
-    _tableSeen = false;
-}
-
 void PreferencesFile::open() {
     giveJournalTheRightsOf(_path);
-    int code = sqlite3_open_v2(_path.c_str(), &_db, SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX, nullptr);
+    _tableSeen = false;
+    _database = std::make_unique<Sqlite>(_path, static_cast<int>(_lockTimeout * 1000), throwPreferencesError,
+                                         Sqlite::Missing::refuse);
     try {
-        if (code != SQLITE_OK) fail(code);
-        sqlite3_extended_result_codes(_db, 1);
-        sqlite3_busy_timeout(_db, static_cast<int>(_lockTimeout * 1000));
-        sqlite3_db_config(_db, SQLITE_DBCONFIG_DEFENSIVE, 1, nullptr);
-        sqlite3_db_config(_db, SQLITE_DBCONFIG_TRUSTED_SCHEMA, 0, nullptr);
+        _database->guard();
         checkFormat();
-        execute("PRAGMA synchronous=FULL");
-        execute("PRAGMA journal_size_limit=4194304");
+        _database->execute("PRAGMA synchronous=FULL; PRAGMA journal_size_limit=4194304");
     } catch (...) {
-        close();
+        _database.reset();
         throw;
     }
 }
 
 void PreferencesFile::checkFormat() {
-    execute("BEGIN"); // one view of the file: another process may be making it now
-    int64_t tables = number("SELECT count(*) FROM sqlite_master");
-    int64_t application = number("PRAGMA application_id"), version = number("PRAGMA user_version");
-    execute("COMMIT");
+    int64_t tables = 0, application = 0, version = 0;
+    {
+        const SqliteSnapshot view(*_database); // another process may be making the file now
+        tables = _database->integer("SELECT count(*) FROM sqlite_master");
+        application = _database->integer("PRAGMA application_id");
+        version = _database->integer("PRAGMA user_version");
+    }
     if (tables == 0) return; // new, or cut off before its first transaction
     if (application != kApplicationID)
         failWith(
@@ -164,11 +139,11 @@ void PreferencesFile::checkFormat() {
 }
 
 bool PreferencesFile::openExisting() {
-    if (_db && hasMoved()) close();
-    if (!_db) {
+    if (_database && _database->hasMoved()) _database.reset();
+    if (!_database) {
         if (!exists(_path)) {
             if (errno == ENOENT || errno == ENOTDIR) return false;
-            failWith(explain(_path, SQLITE_CANTOPEN, errno, "no access"));
+            throwPreferencesError(_path, {SQLITE_CANTOPEN, errno, "no access", "open"});
         }
         open();
     }
@@ -177,11 +152,11 @@ bool PreferencesFile::openExisting() {
 
 void PreferencesFile::createFile() {
     CXPathUtils_MakeCompletePath(directoryOf(_path), 0700);
-    int fd = ::open(_path.c_str(), O_RDWR | O_CREAT | O_EXCL | O_CLOEXEC, 0600);
+    const int fd = ::open(_path.c_str(), O_RDWR | O_CREAT | O_EXCL | O_CLOEXEC, 0600);
     if (fd < 0) {
         if (errno == EEXIST) return; // another process was faster
-        failWith(explain(_path, errno == EROFS || errno == EACCES ? SQLITE_READONLY : SQLITE_CANTOPEN, errno,
-                         std::strerror(errno)));
+        const int code = errno == EROFS || errno == EACCES ? SQLITE_READONLY : SQLITE_CANTOPEN;
+        throwPreferencesError(_path, {code, errno, std::strerror(errno), "make"});
     }
     ::fchmod(fd, 0600); // whatever the umask
     ::close(fd);
@@ -189,128 +164,77 @@ void PreferencesFile::createFile() {
 
 void PreferencesFile::openOrCreate() {
     if (openExisting()) return;
-    if (!_db) {
+    if (!_database) {
         createFile();
         open();
     }
-    // Refused on a file system without shared memory and while another process makes the file: the rollback journal
-    // serves as well.
-    sqlite3_exec(_db, "PRAGMA journal_mode=WAL", nullptr, nullptr, nullptr);
+    try {
+        _database->execute("PRAGMA journal_mode=WAL");
+    } catch (const CXException&) {
+        // Refused on a file system without shared memory and while another process makes the file: the rollback
+        // journal serves as well.
+    }
 }
 
 bool PreferencesFile::hasTable() {
-    if (!_tableSeen) _tableSeen = number("SELECT count(*) FROM sqlite_master WHERE name = 'preferences'") != 0;
+    if (!_tableSeen)
+        _tableSeen = _database->integer("SELECT count(*) FROM sqlite_master WHERE name = 'preferences'") != 0;
     return _tableSeen;
-}
-
-int64_t PreferencesFile::number(const char* sql) {
-    auto statement = prepare(sql);
-    return step(statement.get()) ? sqlite3_column_int64(statement.get(), 0) : 0;
-}
-
-void PreferencesFile::execute(const char* sql) {
-    if (int code = sqlite3_exec(_db, sql, nullptr, nullptr, nullptr); code != SQLITE_OK) fail(code);
-}
-
-PreferencesFile::Statement PreferencesFile::prepare(const char* sql) {
-    sqlite3_stmt* statement = nullptr;
-    int code = sqlite3_prepare_v2(_db, sql, -1, &statement, nullptr);
-    if (code != SQLITE_OK) fail(code);
-    return Statement(statement);
-}
-
-bool PreferencesFile::step(sqlite3_stmt* statement) {
-    int code = sqlite3_step(statement);
-    if (code == SQLITE_ROW) return true;
-    if (code != SQLITE_DONE) fail(code);
-    return false;
-}
-
-void PreferencesFile::bindText(sqlite3_stmt* statement, int index, std::string_view text) {
-    int code =
-        sqlite3_bind_text64(statement, index, text.data() ? text.data() : "", text.size(), SQLITE_STATIC, SQLITE_UTF8);
-    if (code != SQLITE_OK) fail(code);
 }
 
 std::optional<Bytes> PreferencesFile::read(std::string_view domain, std::string_view key) {
     if (!openExisting()) return {};
-    auto statement = prepare("SELECT rowid, length(value) FROM preferences WHERE domain = ?1 AND key = ?2");
-    bindText(statement.get(), 1, domain);
-    bindText(statement.get(), 2, key);
-    if (!step(statement.get())) return {};
-    // Straight into place: as a column, a large value would stand in memory twice. The open statement keeps the view.
-    Bytes bytes(static_cast<size_t>(sqlite3_column_int64(statement.get(), 1)));
-    sqlite3_blob* blob = nullptr;
-    int code =
-        sqlite3_blob_open(_db, "main", "preferences", "value", sqlite3_column_int64(statement.get(), 0), 0, &blob);
-    if (code == SQLITE_OK && sqlite3_blob_bytes(blob) != static_cast<int>(bytes.size())) code = SQLITE_CORRUPT;
-    if (code == SQLITE_OK) code = sqlite3_blob_read(blob, bytes.data(), static_cast<int>(bytes.size()), 0);
-    if (code != SQLITE_OK) {
-        sqlite3_blob_close(blob);
-        fail(code);
-    }
-    sqlite3_blob_close(blob);
-    return bytes;
-}
-
-std::vector<std::string> PreferencesFile::strings(const char* sql, std::optional<std::string_view> argument) {
-    if (!openExisting()) return {};
-    auto statement = prepare(sql);
-    if (argument) bindText(statement.get(), 1, *argument);
-    std::vector<std::string> out;
-    while (step(statement.get())) {
-        auto* text = reinterpret_cast<const char*>(sqlite3_column_text(statement.get(), 0));
-        out.emplace_back(text ? text : "", static_cast<size_t>(sqlite3_column_bytes(statement.get(), 0)));
-    }
-    return out;
+    auto statement =
+        _database->statement("SELECT rowid, length(value) FROM preferences WHERE domain = ?1 AND key = ?2");
+    if (!statement.bind(1, domain).bind(2, key).step()) return {};
+    // The open statement keeps the view.
+    return _database->blob("preferences", "value", statement.integer(0), static_cast<size_t>(statement.integer(1)));
 }
 
 std::vector<std::string> PreferencesFile::keys(std::string_view domain) {
-    return strings("SELECT key FROM preferences WHERE domain = ?1 ORDER BY key", domain);
+    std::vector<std::string> keys;
+    if (!openExisting()) return keys;
+    auto statement = _database->statement("SELECT key FROM preferences WHERE domain = ?1 ORDER BY key");
+    for (statement.bind(1, domain); statement.step();) keys.push_back(statement.text(0));
+    return keys;
 }
 
 std::vector<std::string> PreferencesFile::domains() {
-    return strings("SELECT DISTINCT domain FROM preferences ORDER BY domain", {});
+    std::vector<std::string> domains;
+    if (!openExisting()) return domains;
+    auto statement = _database->statement("SELECT DISTINCT domain FROM preferences ORDER BY domain");
+    while (statement.step()) domains.push_back(statement.text(0));
+    return domains;
 }
 
 void PreferencesFile::write(std::string_view domain, const Changes& changes) {
     openOrCreate();
-    execute("BEGIN IMMEDIATE");
     try {
-        if (!hasTable()) {
-            execute("CREATE TABLE preferences (domain TEXT NOT NULL, key TEXT NOT NULL, value BLOB NOT NULL, "
-                    "PRIMARY KEY (domain, key)) STRICT");
-            execute(fmt::format("PRAGMA application_id={}", kApplicationID).c_str());
-            execute(fmt::format("PRAGMA user_version={}", kFormatVersion).c_str());
-        }
+        SqliteTransaction transaction(*_database);
+        if (!hasTable())
+            _database->execute(
+                fmt::format("CREATE TABLE preferences (domain TEXT NOT NULL, key TEXT NOT NULL, value BLOB NOT NULL, "
+                            "PRIMARY KEY (domain, key)) STRICT; "
+                            "PRAGMA application_id={}; PRAGMA user_version={}",
+                            kApplicationID, kFormatVersion));
         applyChanges(domain, changes);
-        execute("COMMIT");
+        transaction.commit();
     } catch (...) {
-        rollBack();
+        _tableSeen = false;
         throw;
     }
 }
 
-void PreferencesFile::rollBack() noexcept {
-    _tableSeen = false;
-    if (!sqlite3_get_autocommit(_db)) sqlite3_exec(_db, "ROLLBACK", nullptr, nullptr, nullptr);
-}
-
 void PreferencesFile::applyChanges(std::string_view domain, const Changes& changes) {
-    auto put = prepare("INSERT INTO preferences (domain, key, value) VALUES (?1, ?2, ?3) "
-                       "ON CONFLICT (domain, key) DO UPDATE SET value = excluded.value");
-    auto erase = prepare("DELETE FROM preferences WHERE domain = ?1 AND key = ?2");
+    auto put = _database->statement("INSERT INTO preferences (domain, key, value) VALUES (?1, ?2, ?3) "
+                                    "ON CONFLICT (domain, key) DO UPDATE SET value = excluded.value");
+    auto erase = _database->statement("DELETE FROM preferences WHERE domain = ?1 AND key = ?2");
     for (const auto& [key, bytes] : changes) {
-        sqlite3_stmt* statement = (bytes ? put : erase).get();
-        bindText(statement, 1, domain);
-        bindText(statement, 2, key);
-        if (bytes) {
-            const void* data = bytes->empty() ? "" : static_cast<const void*>(bytes->data());
-            if (int code = sqlite3_bind_blob64(statement, 3, data, bytes->size(), SQLITE_STATIC); code != SQLITE_OK)
-                fail(code);
-        }
-        step(statement);
-        sqlite3_reset(statement);
+        auto& statement = bytes ? put : erase;
+        statement.bind(1, domain).bind(2, key);
+        if (bytes) statement.bind(3, *bytes);
+        statement.run();
+        statement.reset();
     }
 }
 

@@ -1,15 +1,13 @@
 #pragma once
 
 #include "foundation/Preferences.h"
+#include "foundation/Sqlite.h"
 
 #include <memory>
 #include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
-
-struct sqlite3;
-struct sqlite3_stmt;
 
 namespace rolvane {
 
@@ -22,7 +20,6 @@ public:
     using Changes = PreferencesChanges;
 
     PreferencesFile(std::string path, double lockTimeoutSeconds);
-    ~PreferencesFile();
     PreferencesFile(const PreferencesFile&) = delete;
     PreferencesFile& operator=(const PreferencesFile&) = delete;
 
@@ -33,32 +30,17 @@ public:
     const std::string& path() const { return _path; }
 
 private:
-    struct StatementCloser {
-        void operator()(sqlite3_stmt* statement) const;
-    };
-    using Statement = std::unique_ptr<sqlite3_stmt, StatementCloser>;
-
     bool openExisting(); // false: there is no file, or no table in it yet
     void openOrCreate();
     void createFile();
     void open();
-    void close();
-    bool hasMoved() const;
     void checkFormat();
     bool hasTable();
-    int64_t number(const char* sql);
-    void execute(const char* sql);
-    void rollBack() noexcept;
     void applyChanges(std::string_view domain, const Changes& changes);
-    std::vector<std::string> strings(const char* sql, std::optional<std::string_view> argument);
-    Statement prepare(const char* sql);
-    bool step(sqlite3_stmt* statement);
-    void bindText(sqlite3_stmt* statement, int index, std::string_view text);
-    [[noreturn]] void fail(int code) const;
 
     std::string _path;
     double _lockTimeout;
-    sqlite3* _db = nullptr;
+    std::unique_ptr<Sqlite> _database;
     bool _tableSeen = false;
 };
 

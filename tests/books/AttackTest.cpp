@@ -1,7 +1,7 @@
 #include "BooksWorld.h"
 
-#include "contacts/database/Sqlite.h"
 #include "foundation/Paths.h"
+#include "foundation/Sqlite.h"
 
 #include <algorithm>
 #include <apr_general.h>

@@ -1,6 +1,6 @@
 #include "BooksWorld.h"
 
-#include "contacts/database/Sqlite.h"
+#include "foundation/Sqlite.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>

@@ -1,8 +1,8 @@
 #include "BooksWorld.h"
 
-#include "contacts/database/Sqlite.h"
 #include "contacts/records/PersonJoining.h"
 #include "contacts/vcard/VCardFields.h"
+#include "foundation/Sqlite.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>

@@ -2,8 +2,8 @@
 
 #include "CaptureWorld.h"
 #include "contacts/database/DamagedDatabase.h"
-#include "contacts/database/Sqlite.h"
 #include "foundation/Log.h"
+#include "foundation/Sqlite.h"
 #include "support/CapturingLog.h"
 
 #include <cstdlib>

@@ -2,9 +2,9 @@
 
 #include "contacts/database/ChangeLog.h"
 #include "contacts/database/History.h"
-#include "contacts/database/Sqlite.h"
 #include "contacts/records/PersonJoining.h"
 #include "foundation/PropertyList.h"
+#include "foundation/Sqlite.h"
 
 #include <algorithm>
 #include <fstream>

@@ -1,8 +1,8 @@
 #include "contacts/database/DaemonMemory.h"
 
 #include "TestDatabase.h"
-#include "contacts/database/Sqlite.h"
 #include "foundation/CXException.h"
+#include "foundation/Sqlite.h"
 
 #include <filesystem>
 

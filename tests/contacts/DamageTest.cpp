@@ -4,8 +4,8 @@
 #include "TestDatabase.h"
 
 #include "contacts/database/DamagedDatabase.h"
-#include "contacts/database/Sqlite.h"
 #include "foundation/Preferences.h"
+#include "foundation/Sqlite.h"
 
 #include <filesystem>
 

@@ -1,6 +1,6 @@
 #pragma once
 
-#include "contacts/database/Sqlite.h"
+#include "foundation/Sqlite.h"
 
 #include <gtest/gtest.h>
 #include <string>

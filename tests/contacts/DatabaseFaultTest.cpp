@@ -1,6 +1,6 @@
 #include "TestDatabase.h"
 
-#include "contacts/database/Sqlite.h"
+#include "foundation/Sqlite.h"
 
 #include <csignal>
 #include <filesystem>

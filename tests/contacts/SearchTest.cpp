@@ -1,8 +1,8 @@
 #include "TestDatabase.h"
 
-#include "contacts/database/Sqlite.h"
 #include "contacts/records/Constants.h"
 #include "contacts/records/SearchText.h"
+#include "foundation/Sqlite.h"
 
 #include <fstream>
 

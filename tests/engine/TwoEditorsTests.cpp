@@ -2,8 +2,8 @@
 
 #include "TwoUsers.h"
 #include "Writes.h"
-#include "contacts/database/Sqlite.h"
 #include "foundation/CXException.h"
+#include "foundation/Sqlite.h"
 
 #include <cstdlib>
 

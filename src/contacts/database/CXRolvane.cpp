@@ -1,6 +1,7 @@
 #include "contacts/database/CXRolvane.h"
 
 #include "contacts/database/DamagedDatabase.h"
+#include "contacts/database/DatabaseErrors.h"
 #include "contacts/database/RolvaneImpl.h"
 #include "foundation/Log.h"
 #include "foundation/Paths.h"
@@ -33,8 +34,8 @@ CXRolvane::Options filledIn(CXRolvane::Options options) {
 CXRolvane::Impl::Impl(CXRolvane& owner, Options given)
     : face(owner), options(filledIn(std::move(given))), clock(options.clock ? *options.clock : Clock::system()),
       center(options.center ? *options.center : NotificationCenter::defaultCenter()),
-      sqlite(RecordStore::makeIfMissing(options.path, options.busyTimeoutMilliseconds),
-             options.busyTimeoutMilliseconds),
+      sqlite(RecordStore::makeIfMissing(options.path, options.busyTimeoutMilliseconds), options.busyTimeoutMilliseconds,
+             throwDatabaseError),
       store(sqlite), journal(sqlite), commonVersions(sqlite), reachedStore(sqlite), conflicts(sqlite),
       formerVersions(sqlite), changeLog(sqlite), identity(store.identity()),
       anchor(std::make_shared<CXRolvane* const>(&owner)) {}

@@ -1,7 +1,7 @@
 #pragma once
 
-#include "contacts/database/Sqlite.h"
 #include "foundation/Date.h"
+#include "foundation/Sqlite.h"
 #include "foundation/StrongString.h"
 
 #include <memory>

@@ -1,7 +1,7 @@
 #pragma once
 
-#include "contacts/database/Sqlite.h"
 #include "contacts/records/ContactMerge.h"
+#include "foundation/Sqlite.h"
 #include "foundation/StrongString.h"
 
 #include <optional>

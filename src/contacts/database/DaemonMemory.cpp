@@ -1,5 +1,6 @@
 #include "contacts/database/DaemonMemory.h"
 
+#include "contacts/database/DatabaseErrors.h"
 #include "contacts/database/RecordStore.h"
 #include "foundation/CXException.h"
 #include "foundation/Paths.h"
@@ -67,7 +68,7 @@ private:
         // An empty file is no database, and what stood in it is lost: opening it makes one.
         if (!std::filesystem::is_regular_file(path, error) || std::filesystem::file_size(path, error) == 0)
             return false;
-        auto database = std::make_unique<Sqlite>(path, kBusyTimeoutMilliseconds);
+        auto database = std::make_unique<Sqlite>(path, kBusyTimeoutMilliseconds, throwDatabaseError);
         const RecordStore ofTheFormat(*database);
         _database = std::move(database);
         return true;

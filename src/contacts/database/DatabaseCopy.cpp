@@ -1,7 +1,8 @@
 #include "contacts/database/DatabaseCopy.h"
 
 #include "contacts/database/DamagedDatabase.h"
-#include "contacts/database/Sqlite.h"
+#include "contacts/database/DatabaseErrors.h"
+#include "foundation/Sqlite.h"
 
 #include <filesystem>
 #include <memory>
@@ -19,7 +20,7 @@ Handle opened(const std::string& path, int flags) {
     sqlite3* raw = nullptr;
     const int code = sqlite3_open_v2(path.c_str(), &raw, flags | SQLITE_OPEN_NOMUTEX, nullptr);
     Handle handle(raw, sqlite3_close_v2);
-    if (code != SQLITE_OK) throwSqliteError(raw, code, path, "open");
+    if (code != SQLITE_OK) throwDatabaseError(path, SqliteFailure::of(raw, code, "open"));
     sqlite3_extended_result_codes(raw, 1);
     sqlite3_busy_timeout(raw, kBusyTimeoutMilliseconds);
     return handle;
@@ -27,16 +28,17 @@ Handle opened(const std::string& path, int flags) {
 
 void copyPages(sqlite3* from, const std::string& fromPath, sqlite3* to, const std::string& toPath) {
     sqlite3_backup* backup = sqlite3_backup_init(to, "main", from, "main");
-    if (!backup) throwSqliteError(to, sqlite3_errcode(to), toPath, "write");
+    if (!backup) throwDatabaseError(toPath, SqliteFailure::of(to, sqlite3_errcode(to), "write"));
     const int stepped = sqlite3_backup_step(backup, -1); // all of it, of one moment
     const int finished = sqlite3_backup_finish(backup);
     const int code = stepped == SQLITE_DONE ? finished : stepped;
     // Which of the two files it was stands in neither answer. A full disk is the copy's, damage the original's.
-    if (code != SQLITE_OK) throwSqliteError(nullptr, code, (code & 0xff) == SQLITE_FULL ? toPath : fromPath, "copy");
+    if (code != SQLITE_OK)
+        throwDatabaseError((code & 0xff) == SQLITE_FULL ? toPath : fromPath, SqliteFailure::of(nullptr, code, "copy"));
 }
 
 void requireWhole(const std::string& copy, const std::string& original) {
-    Sqlite database(copy, kBusyTimeoutMilliseconds);
+    Sqlite database(copy, kBusyTimeoutMilliseconds, throwDatabaseError);
     database.execute("PRAGMA journal_mode=DELETE"); // a single file
     auto check = database.statement("PRAGMA integrity_check(1)");
     const std::string found = check.step() ? check.text(0) : "no answer";
@@ -48,7 +50,7 @@ void requireWhole(const std::string& copy, const std::string& original) {
 void copyDatabase(const std::string& from, const std::string& to) {
     try {
         // Makes the file with its mode.
-        const Sqlite made(to, kBusyTimeoutMilliseconds);
+        const Sqlite made(to, kBusyTimeoutMilliseconds, throwDatabaseError);
         const Handle source = opened(from, SQLITE_OPEN_READWRITE);
         const Handle copy = opened(to, SQLITE_OPEN_READWRITE);
         copyPages(source.get(), from, copy.get(), to);

@@ -1,7 +1,7 @@
 #pragma once
 
 #include "contacts/database/CXRolvane.h"
-#include "contacts/database/Sqlite.h"
+#include "foundation/Sqlite.h"
 
 #include <optional>
 

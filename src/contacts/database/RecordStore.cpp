@@ -5,6 +5,7 @@
 #include "contacts/database/ConflictLog.h"
 #include "contacts/database/DaemonMemory.h"
 #include "contacts/database/DamagedDatabase.h"
+#include "contacts/database/DatabaseErrors.h"
 #include "foundation/Paths.h"
 #include "foundation/PropertyList.h"
 #include "foundation/TestSwitch.h"
@@ -125,7 +126,7 @@ const std::string& RecordStore::makeIfMissing(const std::string& path, int busyT
     static std::atomic<int> made = 0;
     const std::string fresh = path + ".new." + std::to_string(::getpid()) + "." + std::to_string(++made);
     {
-        Sqlite database(fresh, busyTimeoutMilliseconds);
+        Sqlite database(fresh, busyTimeoutMilliseconds, throwDatabaseError);
         const RecordStore filled(database);
     }
     // Never over another process's, which was faster.

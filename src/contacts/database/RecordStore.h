@@ -1,8 +1,8 @@
 #pragma once
 
 #include "contacts/database/CXRolvane.h"
-#include "contacts/database/Sqlite.h"
 #include "contacts/records/RecordKind.h"
+#include "foundation/Sqlite.h"
 
 #include <array>
 #include <functional>

@@ -24,7 +24,7 @@ struct HttpJob {
     bool http1Only = false;
     bool onNewConnection = false; // a kept one has failed it
     bool wasSentTwice() const { return onNewConnection || http1Only; }
-    bool metNoHandshake = false;  // the TLS handshake of a new one has failed, once
+    bool metNoHandshake = false; // the TLS handshake of a new one has failed, once
 
     HttpResponse response;
     bool headerDone = false;  // of the final answer

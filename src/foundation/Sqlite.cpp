@@ -1,7 +1,8 @@
-#include "contacts/database/Sqlite.h"
+#include "foundation/Sqlite.h"
 
-#include "contacts/database/DamagedDatabase.h"
+#include "foundation/CXException.h"
 
+#include <cstdlib>
 #include <fcntl.h>
 #include <sqlite3.h>
 #include <sys/stat.h>
@@ -10,35 +11,6 @@
 namespace rolvane {
 
 namespace {
-
-std::string explanation(int extendedCode, const std::string& detail) {
-    if (extendedCode == SQLITE_IOERR_WRITE) // a quota or a limit on file sizes looks like this
-        return "no room is left for it on its disk, or the disk is failing. Nothing stored was lost; free some space "
-               "and try again.";
-    switch (extendedCode & 0xff) {
-    case SQLITE_FULL: return "no room is left on its disk. Nothing stored was lost; free some space and try again.";
-    case SQLITE_BUSY:
-    case SQLITE_LOCKED:
-        return "another program has kept it locked for too long. Nothing was lost; try again in a moment.";
-    case SQLITE_READONLY:
-    case SQLITE_PERM:
-    case SQLITE_AUTH:
-        return "it cannot be written (" + detail + "). Check the permissions of the file and of its directory.";
-    case SQLITE_CANTOPEN:
-        return "it cannot be opened (" + detail + "). Check that its directory exists and the permissions of both.";
-    case SQLITE_CORRUPT:
-    case SQLITE_NOTADB:
-        return "the file is damaged (" + detail +
-               "). It was left as it is. `rolvane restore FILE` puts a backup in its place.";
-    case SQLITE_IOERR: return "its disk reports an error (" + detail + "). Check the disk, then try again.";
-    default: return detail + ". This is unexpected; please report it.";
-    }
-}
-
-bool isDamage(int extendedCode) {
-    const int code = extendedCode & 0xff;
-    return code == SQLITE_CORRUPT || code == SQLITE_NOTADB;
-}
 
 // The mode holds whatever the umask is; an existing file keeps its own.
 void makePrivateFile(const std::string& path) {
@@ -50,12 +22,43 @@ void makePrivateFile(const std::string& path) {
 
 } // namespace
 
-void throwSqliteError(sqlite3* handle, int code, const std::string& path, std::string_view doing) {
-    std::string detail = handle ? sqlite3_errmsg(handle) : sqlite3_errstr(code);
-    const std::string told =
-        "Could not " + std::string(doing) + " the contact database " + path + ": " + explanation(code, detail);
-    if (isDamage(code)) throw CXDamagedDatabase(told);
-    throw CXException(kCXDatabaseException, told);
+SqliteFailure SqliteFailure::of(sqlite3* handle, int code, std::string_view doing) {
+    // The connection may speak of another failure by now.
+    const bool isOfHandle = handle && (sqlite3_extended_errcode(handle) & 0xff) == (code & 0xff);
+    return {code, isOfHandle ? sqlite3_system_errno(handle) : 0,
+            isOfHandle ? sqlite3_errmsg(handle) : sqlite3_errstr(code), std::string(doing)};
+}
+
+bool SqliteFailure::isDamage() const {
+    return (code & 0xff) == SQLITE_CORRUPT || (code & 0xff) == SQLITE_NOTADB;
+}
+
+std::string cxExplanation(const SqliteFailure& failure) {
+    const std::string& detail = failure.detail;
+    if (failure.code == SQLITE_IOERR_WRITE) // a quota or a limit on file sizes looks like this
+        return "no room is left for it on its disk, or the disk is failing. Nothing stored was lost; free some space "
+               "and try again.";
+    switch (failure.code & 0xff) {
+    case SQLITE_FULL: return "no room is left on its disk. Nothing stored was lost; free some space and try again.";
+    case SQLITE_BUSY:
+    case SQLITE_LOCKED:
+        return "another program has kept it locked for too long. Nothing was lost; try again in a moment.";
+    case SQLITE_READONLY:
+    case SQLITE_PERM:
+    case SQLITE_AUTH:
+        return "it cannot be written (" + detail + "). Check the permissions of the file and of its directory.";
+    case SQLITE_CANTOPEN:
+        return "it cannot be opened (" + detail + "). Check that its directory exists and the permissions of both.";
+    case SQLITE_CORRUPT:
+    case SQLITE_NOTADB: return "the file is damaged (" + detail + "). It was left as it is.";
+    case SQLITE_IOERR: return "its disk reports an error (" + detail + "). Check the disk, then try again.";
+    default: return detail + ". This is unexpected; please report it.";
+    }
+}
+
+void throwSqliteError(const std::string& path, const SqliteFailure& failure) {
+    throw CXException(kCXDatabaseException,
+                      "Could not " + failure.doing + " the database " + path + ": " + cxExplanation(failure));
 }
 
 struct Sqlite::Prepared {
@@ -64,30 +67,40 @@ struct Sqlite::Prepared {
     ~Prepared() { sqlite3_finalize(statement); }
 };
 
-Sqlite::Sqlite(const std::string& path, int busyTimeoutMilliseconds) : _path(path) {
-    makePrivateFile(path);
-    int code = sqlite3_open_v2(path.c_str(), &_handle, SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX, nullptr);
+Sqlite::Sqlite(const std::string& path, int busyTimeoutMilliseconds, SqliteErrors errors, Missing missing)
+    : _path(path), _errors(errors) {
+    if (missing == Missing::make) makePrivateFile(path);
+    const int code = sqlite3_open_v2(path.c_str(), &_handle, SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX, nullptr);
     if (code != SQLITE_OK) {
-        std::unique_ptr<sqlite3, int (*)(sqlite3*)> closing(_handle, sqlite3_close_v2);
-        throwSqliteError(_handle, code, path, "open");
+        const SqliteFailure failure = SqliteFailure::of(_handle, code, "open");
+        sqlite3_close_v2(_handle);
+        _errors(path, failure);
     }
     sqlite3_extended_result_codes(_handle, 1);
     sqlite3_busy_timeout(_handle, busyTimeoutMilliseconds);
 }
 
 void Sqlite::fail(int code, std::string_view doing) {
+    const SqliteFailure failure = SqliteFailure::of(_handle, code, doing);
     try {
-        throwSqliteError(_handle, code, _path, doing);
-    } catch (const CXDamagedDatabase& e) {
-        _damage = e.reason();
+        _errors(_path, failure);
+    } catch (const CXException& e) {
+        if (failure.isDamage()) _damage = e.reason();
         throw;
     }
+    std::abort(); // `errors` always throws
 }
 
 Sqlite::~Sqlite() {
     _prepared.clear();
-    // Of a file that has moved SQLite leaves the log alone: its path may belong to a successor by now.
+    // The log's path may belong to a successor of the file by now, and must not be taken away from it.
+    if (hasMoved()) sqlite3_db_config(_handle, SQLITE_DBCONFIG_NO_CKPT_ON_CLOSE, 1, nullptr);
     sqlite3_close_v2(_handle);
+}
+
+void Sqlite::guard() {
+    sqlite3_db_config(_handle, SQLITE_DBCONFIG_DEFENSIVE, 1, nullptr);
+    sqlite3_db_config(_handle, SQLITE_DBCONFIG_TRUSTED_SCHEMA, 0, nullptr);
 }
 
 std::shared_ptr<Sqlite::Prepared> Sqlite::prepare(std::string_view sql) {
@@ -125,6 +138,17 @@ int Sqlite::changes() const {
 }
 int64_t Sqlite::lastInsertId() const {
     return sqlite3_last_insert_rowid(_handle);
+}
+
+Bytes Sqlite::blob(const char* table, const char* column, int64_t row, size_t size) {
+    Bytes bytes(size);
+    sqlite3_blob* open = nullptr;
+    int code = sqlite3_blob_open(_handle, "main", table, column, row, 0, &open);
+    const std::unique_ptr<sqlite3_blob, int (*)(sqlite3_blob*)> closing(open, sqlite3_blob_close);
+    if (code == SQLITE_OK && sqlite3_blob_bytes(open) != static_cast<int>(size)) code = SQLITE_CORRUPT;
+    if (code == SQLITE_OK) code = sqlite3_blob_read(open, bytes.data(), static_cast<int>(size), 0);
+    if (code != SQLITE_OK) fail(code, "read");
+    return bytes;
 }
 
 Sqlite::Statement::Statement(Sqlite& database, std::shared_ptr<Prepared> prepared)

@@ -13,17 +13,37 @@ struct sqlite3_stmt;
 
 namespace rolvane {
 
-// Turns a failure of SQLite into a CXException kCXDatabaseException: what could not be done, with which file, why, and
-// what to do; a damaged file is a CXDamagedDatabase. The only place that knows SQLite's error codes.
-[[noreturn]] void throwSqliteError(sqlite3* handle, int code, const std::string& path, std::string_view doing);
+// An operation that SQLite could not do.
+struct SqliteFailure {
+    int code = 0;        // SQLite's, extended where it is known
+    int systemError = 0; // errno, 0 when the system did not say no
+    std::string detail;  // SQLite's words
+    std::string doing;   // "open", "read", "write to", "use"
+
+    // `handle` may be null: then nothing but the code is known.
+    static SqliteFailure of(sqlite3* handle, int code, std::string_view doing);
+    bool isDamage() const; // the file's content is wrong
+};
+
+// Why, and what to do, in a few words; the sentence before it says which file. For any kind of file.
+std::string cxExplanation(const SqliteFailure& failure);
+
+// Tells a failure as its owner's users understand it: always throws a CXException.
+using SqliteErrors = void (*)(const std::string& path, const SqliteFailure& failure);
+
+// A CXException kCXDatabaseException of "the database" at that path.
+[[noreturn]] void throwSqliteError(const std::string& path, const SqliteFailure& failure);
 
 // One connection. Not locked: its owner sees to it that one thread at a time uses it. Every failure throws.
 class Sqlite {
     struct Prepared;
 
 public:
-    // Makes the file (0600) when it is missing; waits so long for other writers before "in use" is an error.
-    Sqlite(const std::string& path, int busyTimeoutMilliseconds);
+    enum class Missing { make, refuse }; // a missing file is made, for nobody but its owner (0600), or is an error
+
+    // Waits so long for other writers before "in use" is an error.
+    Sqlite(const std::string& path, int busyTimeoutMilliseconds, SqliteErrors errors = throwSqliteError,
+           Missing missing = Missing::make);
     ~Sqlite();
     Sqlite(const Sqlite&) = delete;
     Sqlite& operator=(const Sqlite&) = delete;
@@ -60,11 +80,16 @@ public:
 
     bool hasMoved() const; // its path names another file by now, or none
 
+    // Commands cannot change the file in ways that are not its content's, and what its schema says is not trusted.
+    void guard();
+
     Statement statement(std::string_view sql); // kept prepared; a second loan of one text prepares another
     void execute(const std::string& sql);      // any number of statements, no results
     int64_t integer(std::string_view sql);     // first column of the first row, 0 when there is none
     int changes() const;                       // rows changed by the last statement
     int64_t lastInsertId() const;
+    // A large value as a whole, in memory once. Within a view of the file that the row was found in.
+    Bytes blob(const char* table, const char* column, int64_t row, size_t size);
     const std::string& path() const { return _path; }
 
     // What SQLite, or whoever compared what it says, has found damaged in the file; "" when nothing was.
@@ -80,6 +105,7 @@ private:
     [[noreturn]] void fail(int code, std::string_view doing);
 
     std::string _path;
+    SqliteErrors _errors;
     sqlite3* _handle = nullptr;
     std::string _damage;
     bool _writing = false; // a write transaction is open: what fails now is the writing
