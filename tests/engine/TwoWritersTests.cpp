@@ -374,6 +374,34 @@ TEST_F(TwoWriters, AContactThatIsNowhereAndThatAWriterHasListedIsNamedNoLonger) 
     for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
 }
 
+// A list is written before the groups that name the same contact, and somebody who may not write reads in between.
+TEST_F(TwoWriters, NobodyIsToldOfARefusalWhereNewsTookAMemberAway) {
+    bob.pass();
+    const UniqueId gone = people[0]->uniqueId();
+    const auto list = world->file(std::string(kCXAllGroupUID));
+    Dictionary everybody = contentOf(list).mutableCopy();
+    Array left = everybody["memberUIDState"].array().mutableCopy();
+    left.removeAll(gone);
+    everybody.set("memberUIDState", left);
+    rewrite(list, PropertyList::toXML(everybody));
+    std::filesystem::remove(fileOf(gone));
+    bob.pass();
+    ASSERT_FALSE(bob.copyOf(people[0])) << log.text();
+    int refused = 0;
+    bob.wire->intercept([&](const HttpRequest& request) {
+        const bool isWrite = request.method == "PUT" && request.url.encodedPath().find("CXGroup") != std::string::npos;
+        refused += isWrite;
+        return isWrite ? std::optional(answerOf(403)) : std::nullopt;
+    });
+    bob.pass();
+    EXPECT_GT(refused, 0) << "the group that the store still has\n" << bob.wire->text();
+    EXPECT_EQ(bob.preferences.get(kDaemonDomain, kCXDRefusedChanges).array().count(), 0u) << log.text();
+    copyOf(friends)->addMember(bob.copyOf(people[1]));
+    bob.application->save();
+    bob.pass();
+    EXPECT_EQ(bob.preferences.get(kDaemonDomain, kCXDRefusedChanges).array().count(), 1u) << log.text();
+}
+
 TEST_F(TwoWriters, AContactsFileThatTheStoreHasLostIsWrittenAgainByItsOwner) {
     bob.pass();
     const auto file = fileOf(people[1]);

@@ -73,8 +73,7 @@ void ApplyLoop::storeAndClose(bool allowRetry) {
 
 void ApplyLoop::storeQueue(bool allowRetry) {
     if (!_queueTaken) append(_pendingChanges, _parts.state.getPendingChanges());
-    for (const CXDChangeRecordPtr& record : _parts.denied.all())
-        if (!isOwnWrite(*record)) _parts.outcomes.refused(record->user().value_or(UserName()));
+    for (const UserName& user : _refusals.ofCopies()) _parts.outcomes.refused(user);
     std::erase_if(_pendingChanges, [&](const CXDChangeRecordPtr& record) { return _parts.denied.contains(*record); });
     CXDLog("Pending: %@", _pendingChanges);
     CXDLog("Denied:  %@", _parts.denied.all());

@@ -2,16 +2,42 @@
 
 #include "contacts/records/Identifier.h"
 #include "engine/memory/PublicationCache.h"
+#include "engine/queue/ChangeQueue.h"
 #include "engine/queue/RefusedChanges.h"
+#include "engine/recovery/Holdings.h"
 #include "engine/recovery/UnderWay.h"
 #include "foundation/TestSwitch.h"
 #include "model/PayloadKeys.h"
 #include "model/RemoteLocationMap.h"
 
+#include <algorithm>
 #include <optional>
 #include <vector>
 
 namespace rolvane {
+
+namespace {
+
+// News have taken contacts or groups away before the store said that they left this group, too. So they have left the
+// copy of the group, and nobody has edited that.
+bool isDeletionByNews(CXDChangeRecord& record, Holdings& holdings) {
+    if (record.type() != CXDCompositeGroupChange || isListOfEverybody(record)) return false;
+    const Dictionary payload = record.payload().dictionary();
+    const auto isEmpty = [&](const char* part) {
+        const Value& value = payload[part];
+        return value.isArray() ? value.array().empty() : value.dictionary().empty() && !value.isString();
+    };
+    for (const char* part : {kMemberAdds, kSubgroupAdds, kDistributionListAdds, kCXGroupNameProperty})
+        if (!isEmpty(part)) return false;
+    const Array people = payload[kMemberRemoves].array(), groups = payload[kSubgroupRemoves].array();
+    return (!people.empty() || !groups.empty()) &&
+           std::none_of(people.begin(), people.end(),
+                        [&](const Value& name) { return holdings.person(UniqueId(name.string())); }) &&
+           std::none_of(groups.begin(), groups.end(),
+                        [&](const Value& name) { return holdings.group(UniqueId(name.string())); });
+}
+
+} // namespace
 
 bool isGivenUp(EngineParts& parts, const CXDChangeRecord& record) {
     const bool isOfCopy = record.initialSource() == CXDSyncSourceCX && !record.changeMadeByDataOwner();
@@ -36,12 +62,10 @@ void PassRefusals::note() {
 void PassRefusals::tell() {
     const Date now = _parts.with.clock.now();
     std::vector<Refusal> refused = _parts.state.takeRefused();
-    bool ofOwn = false;
-    for (const CXDChangeRecordPtr& record : _parts.denied.all())
-        if (isOwnWrite(*record))
-            ofOwn = true;
-        else
-            refused.push_back({record->user().value_or(UserName())});
+    for (const UserName& user : ofCopies()) refused.push_back({user});
+    const CXDChangeRecords denied = _parts.denied.all();
+    const bool ofOwn =
+        std::any_of(denied.begin(), denied.end(), [](const CXDChangeRecordPtr& record) { return isOwnWrite(*record); });
     if (!refused.empty()) _parts.state.noteRefusedChanges(refused, now);
     size_t waiting = 0;
     _parts.state.withConduitData([&](Dictionary& data) {
@@ -50,6 +74,15 @@ void PassRefusals::tell() {
     });
     _parts.outcomes.rests(kSelf, static_cast<int64_t>(waiting));
     _parts.state.noteRefusedByOwnStore(waiting, ofOwn ? std::optional(now) : std::nullopt);
+}
+
+std::vector<UserName> PassRefusals::ofCopies() const {
+    Holdings holdings(_parts.with.rolvane);
+    std::vector<UserName> users;
+    for (const CXDChangeRecordPtr& record : _parts.denied.all())
+        if (!isOwnWrite(*record) && !isDeletionByNews(*record, holdings))
+            users.push_back(record->user().value_or(UserName()));
+    return users;
 }
 
 void PassRefusals::takeBack() {

@@ -4,6 +4,7 @@
 #include "model/CXDChangeRecord.h"
 
 #include <unordered_set>
+#include <vector>
 
 namespace rolvane {
 
@@ -22,6 +23,8 @@ public:
     // group counts as changed on the store, so that the next comparison finds the store without the change.
     void takeBack();
     void tell();
+    // The refused changes of copies that a person has made, of whose publishers: a record's user for each.
+    std::vector<UserName> ofCopies() const;
 
 private:
     void takeBack(const CXDChangeRecord& record);
