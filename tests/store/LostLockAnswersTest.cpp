@@ -53,7 +53,6 @@ const std::vector<Harm> kHarms{
     {"too late for a gateway", [](const HttpResponse&) { return answerOf(504); }},
     {"an error after all", [](const HttpResponse&) { return answerOf(500); }},
     {"too busy for the second sending", [](const HttpResponse&) { return toTheSecondSending(answerOf(503)); }},
-    {"a second sending that is not allowed", [](const HttpResponse&) { return toTheSecondSending(answerOf(403)); }},
     {"no connection for the second sending",
      [](const HttpResponse&) { return toTheSecondSending(failed(TransportError::refused)); }},
 };

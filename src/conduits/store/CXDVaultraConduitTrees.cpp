@@ -333,7 +333,7 @@ void CXDVaultraConduit::nameAgain(CXDChangeRecords& records) {
         known.arrayFor(isGroup ? kSubgroupUIDState : kMemberUIDState).removeAll(*record->person());
         if (const Value& choice = known[kDistributionListState].dictionary()[record->person()->str()])
             choices.push_back(again(CXDUpdateDistributionList, choice));
-        CXLog("It never came to the store, and is named there again: %@", record->description());
+        CXDLog("It never came to the store, and is named there again: %@", record->description());
         record = again(isGroup ? CXDAddGroupToGroup : CXDAddRecordToGroup);
     }
     records.insert(records.end(), choices.begin(), choices.end());

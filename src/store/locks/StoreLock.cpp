@@ -219,7 +219,7 @@ StoreLock::Had StoreLock::attempt(CXDAVManager::Impl& client, const std::optiona
         const std::string mark = makeUUID();
         const HttpResponse answer = ask({}, mark);
         LockAnswer said = judgeLockAnswer(answer);
-        if (answer.sentTwice && said != LockAnswer::granted && said != LockAnswer::held)
+        if (answer.sentTwice && said == LockAnswer::notNow)
             said = LockAnswer::unheard; // the first one may have been carried out
         const auto failed = [&](Had how) {
             client.session.noteFailure("LOCK", *_endpoint, answer);
