@@ -34,7 +34,8 @@ TEST_F(Sharing, PublishReturnsWhenEverythingIsOnTheStore) {
     ASSERT_EQ(ran.status, kDone) << ran;
     EXPECT_EQ(ran.output, "");
     EXPECT_NE(ran.errors.find("Everything is on the store."), std::string::npos) << ran;
-    EXPECT_EQ(world.namedTree(), (Names{"AllCXGroup", "Family", "People/Ada", "People/Bob", "computers", "dateFile", "info"}));
+    EXPECT_EQ(world.namedTree(),
+              (Names{"AllCXGroup", "Family", "People/Ada", "People/Bob", "computers", "dateFile", "info"}));
     EXPECT_TRUE(world.daemon());
     const auto status = world.json({"status"});
     EXPECT_EQ(status["published"]["everything"], true);

@@ -144,7 +144,9 @@ void stayAndWork(Work& work) {
         stage.tell(daemon->errors());
     }
     daemons.clear();
-    const Verdict verdict = settleAndJudge(stage, {});
+    Settling settling;
+    settling.later = 8 * 86400; // names without contacts and contacts without names are left for a week
+    const Verdict verdict = settleAndJudge(stage, settling);
     wrong.insert(wrong.end(), verdict.wrong.begin(), verdict.wrong.end());
     work.told(std::to_string(made) + " passes, " + std::to_string(stage.model().deeds) + " changes, " +
               std::to_string(faults) + " of " + std::to_string(requests) +
