@@ -506,20 +506,6 @@ TEST_F(TakenBackPass, ANewGroupThatItsOwnerDeletesWithinTheWeekStaysDeleted) {
 }
 
 // Its name stood in the list for a week, its file never came, and the owner's daemon has taken the name out.
-TEST_F(TakenBackPass, ANewContactWhoseNameItsOwnerHasTakenForALeftoverIsWrittenAgain) {
-    const CXPersonRef dora = addToAlices("Dora");
-    const auto copy = std::dynamic_pointer_cast<CXGroup>(copyOf(friends, kCXSubscribedGroupTable));
-    copy->addMember(dora);
-    bob.application->save();
-    const UniqueId shared = cxNormalizedUID(dora->uniqueId());
-    leaveHalf(shared);
-    settle();
-    EXPECT_TRUE(isOnTheStore(shared)) << log.text();
-    EXPECT_EQ(alice.countPeople(), 4u);
-    EXPECT_EQ(friends->memberUniqueIds().size(), 3u);
-    EXPECT_TRUE(bob.application->recordForUniqueId(dora->uniqueId()));
-}
-
 TEST_F(TakenBackPass, ANewGroupWhoseNameItsOwnerHasTakenForALeftoverIsWrittenAgain) {
     const CXGroupRef circle = groupInAlices("Circle");
     circle->addMember(bob.copyOf(people[1]));

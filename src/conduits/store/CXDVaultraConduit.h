@@ -163,7 +163,7 @@ private:
     bool allGroupHas(const char* property);
     void compareUnlistedGroups(CXDChangeRecords& records);
     void nameAgain(CXDChangeRecords& records);
-    bool wasNeverThere(const UserName& user, const UniqueId& name);
+    bool wasNeverThere(const UserName& user, const UniqueId& group);
     void compareWhatHadCome(CXDChangeRecords& records);
     std::vector<CXReached> whatHadCome();
     void forgetWhatIsKnown();

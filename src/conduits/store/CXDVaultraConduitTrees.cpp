@@ -301,59 +301,43 @@ void CXDVaultraConduit::compareWhatHadCome(CXDChangeRecords& records) {
     }
 }
 
-// A name may come into the list of everybody before its file. When the file does not follow within a week, the owner's
-// daemon takes the name for a leftover and removes it from all lists. Nobody ever had such a record, so it was not
-// deleted: its maker's daemon, which still has the file to write, writes the names again.
+// A new group's name comes into the list of everybody before its file. When the file does not follow within a week, the
+// owner's daemon takes the name for a leftover and removes it from all lists. Nobody ever had such a group, so it was
+// not deleted: its maker's daemon, which still has the file to write, writes the names again.
 void CXDVaultraConduit::nameAgain(CXDChangeRecords& records) {
     if (isLeftOut("named again")) return;
-    const auto isRemoval = [](const CXDChangeRecord& record) {
-        return (record.type() == CXDRemoveRecordFromGroup || record.type() == CXDRemoveGroupFromGroup) &&
-               record.user() && record.person() && record.group();
-    };
     std::set<std::pair<UserName, UniqueId>> taken;
+    const auto isRemoval = [](const CXDChangeRecord& record) {
+        return record.type() == CXDRemoveGroupFromGroup && record.user() && record.person() && record.group();
+    };
     for (const CXDChangeRecordPtr& record : records)
         if (isRemoval(*record) && record->group()->str() == layout::kAllGroup &&
             wasNeverThere(*record->user(), *record->person()))
             taken.emplace(*record->user(), *record->person());
     if (taken.empty()) return;
-    CXDChangeRecords choices;
+    Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
     for (CXDChangeRecordPtr& record : records) {
         if (!isRemoval(*record) || !taken.contains({*record->user(), *record->person()})) continue;
-        const auto again = [&](CXDChangeType type, const Value& payload = {}) {
-            auto change = std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, type, record->user(), record->person(),
-                                                            record->group(), payload);
-            change->setAppliesToSources(conduitSource());
-            return change;
-        };
-        const bool isGroup = record->type() == CXDRemoveGroupFromGroup;
-        Dictionary known = engine()
-                               .conduitObjectForKey(kConduitVaultra, kPriorState)
-                               .dictionaryFor(record->user()->str())
-                               .dictionaryFor(cxUIDWithTableName(*record->group(), kCXGroupTable).str());
-        known.arrayFor(isGroup ? kSubgroupUIDState : kMemberUIDState).removeAll(*record->person());
-        if (const Value& choice = known[kDistributionListState].dictionary()[record->person()->str()])
-            choices.push_back(again(CXDUpdateDistributionList, choice));
+        users.dictionaryFor(record->user()->str())
+            .dictionaryFor(cxUIDWithTableName(*record->group(), kCXGroupTable).str())
+            .arrayFor(kSubgroupUIDState)
+            .removeAll(*record->person());
         CXDLog("It never came to the store, and is named there again: %@", record->description());
-        record = again(isGroup ? CXDAddGroupToGroup : CXDAddRecordToGroup);
+        record = std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, CXDAddGroupToGroup, record->user(),
+                                                   record->person(), record->group());
+        record->setAppliesToSources(conduitSource());
     }
-    records.insert(records.end(), choices.begin(), choices.end());
 }
 
-// No file of the new contact or group is known to have been on the store, and a leftover's time is over for it.
-bool CXDVaultraConduit::wasNeverThere(const UserName& user, const UniqueId& name) {
-    if (!mergesInto(user)) return false;
-    const bool isGroup = name.endsWith(kCXGroupTable);
-    const UniqueId uid = nameInDatabase(user, name);
-    const CXRecordRef record = _world.rolvane.recordForUniqueId(uid);
+// No file of the group is known to have been on somebody else's store, and a leftover's time is over for it.
+bool CXDVaultraConduit::wasNeverThere(const UserName& user, const UniqueId& group) {
+    if (user == kSelf || !mergesInto(user)) return false;
+    const CXRecordRef record = _world.rolvane.recordForUniqueId(nameInDatabase(user, group));
     if (!record) return false;
     const auto made = record->valueForProperty(kCXCreationDateProperty).date();
     if (!made || _world.clock.now().secondsSince(*made) < kPatience) return false;
     const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
-    const Dictionary prior = users[user.str()].dictionary();
-    if (isGroup) return prior[name.str()].dictionary().empty();
-    const auto base = baseLocationForUser(realUserFromUser(user));
-    return base && !prior[kPeopleState].dictionary()[kMemberUIDState].dictionary().contains(name.str()) &&
-           !_world.manager.remembersVersion(layout::contactLocation(*base, name));
+    return users[user.str()].dictionary()[group.str()].dictionary().empty();
 }
 
 // Without those that the states know by now, and those that a leftover's time is over for.
