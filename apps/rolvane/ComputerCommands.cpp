@@ -62,7 +62,7 @@ std::optional<Lists> listsOf(CXDAVManager& store, const Url& base) {
     return lists;
 }
 
-// What a person has here, and how much of that is there as well.
+// The counts of a person's own contacts, and of those that are there as well.
 struct Meeting {
     size_t peopleHere = 0, groupsHere = 0, peopleThere = 0, groupsThere = 0, peopleOfBoth = 0;
 };

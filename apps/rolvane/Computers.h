@@ -24,7 +24,7 @@ std::string computerText(const Computer& computer);
 std::string computersText(const std::vector<Computer>& computers); // several, with commas and "and"
 nlohmann::ordered_json computersJson(Preferences& preferences, const std::vector<Computer>& computers);
 
-// What lies in the account's tree: whether it has contacts, and whose. Some requests; makes nothing.
+// The account's tree: whether it has contacts, and whose. Some requests; makes nothing.
 struct OwnTree {
     std::string serial; // "" where there is none, or it cannot be read
     bool hasList = false;

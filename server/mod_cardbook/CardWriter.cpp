@@ -94,7 +94,7 @@ std::optional<Member> CardWriter::toBeBroughtBack(const ClientCard& card) {
     return left;
 }
 
-// Who has left a group is edited in "Contacts" from now on. False: there is no such person any more.
+// People who have left a group are edited in "Contacts" from now on. False: there is no such person any more.
 bool CardWriter::goToContacts(const Member& departed) {
     const auto own = _memory.of(kContactsBook, departed.uid);
     if (!own) return false;

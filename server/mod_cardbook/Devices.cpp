@@ -50,7 +50,7 @@ void Devices::noteTold(const std::string& device, const std::string& book, const
     s.bind(1, device).bind(2, book).bind(3, departed.uid.str()).bind(4, departed.sequence).run();
 }
 
-// Who never looked into the book has had none of its cards.
+// A device that never looked into the book has had none of its cards.
 bool Devices::isUnawareOf(const std::string& device, const std::string& book, const Member& departed) {
     const int64_t looked = lookedAt(device, book), listed = toldOf(device, book, "");
     if (looked < 0 && listed < 0) return false;

@@ -163,7 +163,7 @@ private:
 
     bool sendsWholeCards() const { return _request.data && _request.data->lines.empty(); }
 
-    // Whoever is sent a whole book has all of its cards, and needs no note of each.
+    // A device that is sent a whole book has all of its cards, and needs no note of each.
     void noteHad(const Member& member, const Card& card) {
         if (!_notesEach) return;
         if (!_lookedAt) _lookedAt = Devices(_library.memory()).lookedAt(_resource.r->user, book());

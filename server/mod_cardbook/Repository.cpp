@@ -23,7 +23,7 @@ Resource resourceAt(request_rec* r, const std::string& base, const Place& place)
     return it;
 }
 
-// Whoever asks for a card that has left its book is going to be told so.
+// A device that asks for a card that has left its book is going to be told so.
 void noteAskedInVain(const Resource& it) {
     if (it.r->method_number != M_GET || it.place.kind != Place::Kind::card || !it.book || it.member) return;
     BookMemory& memory = it.library->memory();

@@ -90,7 +90,7 @@ bool CXDVaultraConduit::keepsInStepWithOthers(Dictionary prior, const Dictionary
     if (_isOneOfSeveral || std::all_of(computers->begin(), computers->end(), isSelf)) return true;
     CXLog("Another computer keeps this publication in step, too.");
     becomeOneOfSeveral(_world.preferences);
-    // What the other one has written is not taken in by this pass, so nothing is written over it either.
+    // This pass takes in nothing of the other one's, so it writes over nothing of it either.
     _isOneOfSeveral = _isWrittenByOthers = _ownTreeIsHeld = true;
     _world.manager.mendOwnTreeOnly(true);
     engine().bringSourcesUpToDate(); // after this pass

@@ -10,7 +10,7 @@ constexpr const char *kId = "id", *kName = "name", *kSeen = "seen";
 constexpr int kMissing = 404;
 constexpr int kAnother = 412; // somebody has written meanwhile
 constexpr int kTries = 4;
-// Whoever may write in the tree may write this file. Nobody has so many computers, nor such names.
+// All who may write in the tree may write this file. Nobody has so many computers, nor such names.
 constexpr size_t kMostComputers = 50, kLongestText = 100;
 
 Dictionary entryOf(const Computer& computer) {
