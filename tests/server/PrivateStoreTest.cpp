@@ -2,8 +2,10 @@
 #include "StoreTestWorld.h"
 #include "foundation/CXException.h"
 #include "foundation/Paths.h"
+#include "server/LoopbackPort.h"
 #include "server/StoreConfiguration.h"
 #include "server/StoreProcess.h"
+#include "support/WaitUntil.h"
 #include "support/WithoutInotify.h"
 
 #include <arpa/inet.h>
@@ -401,9 +403,10 @@ TEST(PrivateStore, IsNotDeceivedByTheProcessNumberOfADeadStore) {
     const StoreDirectory directory;
     PrivateStore store(optionsIn(directory));
     store.start();
-    const pid_t master = store.status().pid;
-    kill(-master, SIGKILL);
-    waitpid(master, nullptr, 0);
+    const PrivateStoreStatus before = store.status();
+    kill(-before.pid, SIGKILL);
+    waitpid(before.pid, nullptr, 0);
+    ASSERT_TRUE(test::waitUntil([&] { return LoopbackPort::isFree(before.port); }, "the last worker's end"));
     // The number now belongs to this very program.
     writeFileDurably(directory.path("store/run/httpd.pid"), std::to_string(getpid()) + "\n");
     EXPECT_FALSE(store.status().running);
