@@ -6,7 +6,7 @@
 
 namespace rolvane {
 
-// What the passes of this process have done, as a text file in the form that Prometheus reads (docs/formats.md):
+// The deeds of this process's passes, as a text file in the form that Prometheus reads (docs/formats.md):
 // written whole at the end of each pass, without the name of anybody. Counters begin anew with each process. On the
 // main thread.
 class PassCounters {

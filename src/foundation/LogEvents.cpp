@@ -39,7 +39,8 @@ constexpr std::array kKinds{&kEnded,         &kAlreadyRunning, &kPassFailed,    
                             &kConfiguration, &kStore,          &kComputers,     &kProgress};
 
 // A line of the log, its kind, and for each placeholder whether its argument may be shown to everybody ('-'), has to be
-// cleared of names first ('t', see withoutNames), or is a name or a content itself ('n').
+// cleared of names first ('t', see withoutNames), or is a name or a content itself ('n'). Lines of a failed pass or
+// change are shown whole: nobody could find the failure without them.
 struct Line {
     std::string_view format;
     const LogKind* kind;
@@ -64,16 +65,16 @@ constexpr Line kLines[] = {
     {"An entry in %@ is too large to be read and left out: %@", &kStrangeContent, "tn"},
     {"An entry with a strange name in %@ is left out: %@", &kStrangeContent, "tn"},
     {"An entry with a strange name in the listing of %@ is left out.", &kStrangeContent, "t"},
-    {"Change record: %@", &kChangeFailed, "n"},
+    {"Change record: %@", &kChangeFailed, "-"},
     {"Changes of the network are not noticed: %@", &kWatches, "t"},
     {"Changes that wait in the database are left for the next start: %@", &kPassFailed, "t"},
     {"Commands reach this daemon by the session bus only: %@", &kNotifications, "t"},
-    {"Could not get group info at: %@, error: %d", &kStore, "t-"},
-    {"Could not retrieve info for files in subscription: %@", &kStore, "t"},
+    {"Could not get group info at: %@, error: %d", &kStore, "--"},
+    {"Could not retrieve info for files in subscription: %@", &kStore, "-"},
     {"ERR: %s", &kStore, "-"},
-    {"Exception saving ACL: %@", &kRightsNotSet, "t"},
-    {"Exception with applying change record: %@", &kChangeFailed, "t"},
-    {"Exception with reading change record: %@", &kChangeFailed, "t"},
+    {"Exception saving ACL: %@", &kRightsNotSet, "-"},
+    {"Exception with applying change record: %@", &kChangeFailed, "-"},
+    {"Exception with reading change record: %@", &kChangeFailed, "-"},
     {"Lock tokens are not written down: %@", &kLock, "t"},
     {"More than %@ notifications wait for their observers: the oldest are dropped.", &kNotifications, "-"},
     {"Notes of new records are kept until the next pass: %@", &kMemoryNotKept, "t"},
@@ -81,10 +82,10 @@ constexpr Line kLines[] = {
     {"Notification %@ cannot be sent: %@.", &kNotifications, "-t"},
     {"Only %d of %d workers could be started: %s", &kPassFailed, "--t"},
     {"Progress of a change record could not be reported: %@", &kNotifications, "t"},
-    {"Quitting due to an unhandled exception: %@", &kEnded, "t"},
+    {"Quitting due to an unhandled exception: %@", &kEnded, "-"},
     {"RolvaneManager is already running (process %d) and serves this user; this one ends.", &kAlreadyRunning, "-"},
-    {"SyncEngine out of order workloop caught (CX) %@: %@", &kChangeFailed, "-t"},
-    {"SyncEngine out of order workloop caught (Vaultra) %@: %@", &kChangeFailed, "-t"},
+    {"SyncEngine out of order workloop caught (CX) %@: %@", &kChangeFailed, "--"},
+    {"SyncEngine out of order workloop caught (Vaultra) %@: %@", &kChangeFailed, "--"},
     {"The access list of %@ could not be set: %@", &kRightsNotSet, "tt"},
     {"The configuration is not used: %@", &kConfiguration, "t"},
     {"The contact database %@ was damaged. Its indexes have been rebuilt, and the whole file is in order again.",
@@ -118,9 +119,9 @@ constexpr Line kLines[] = {
     {"\"%@\" is a name of the published tree's own, and no contact or group can be kept under it. The change stays in "
      "this database: %@",
      &kChangeFailed, "nn"},
-    {"applyChangeRecords close: Caught %@: %@", &kPassFailed, "-t"},
-    {"applyChangeRecords: Caught %@: %@", &kPassFailed, "-t"},
-    {"bringSourcesUpToDate: Caught %@: %@", &kPassFailed, "-t"},
+    {"applyChangeRecords close: Caught %@: %@", &kPassFailed, "--"},
+    {"applyChangeRecords: Caught %@: %@", &kPassFailed, "--"},
+    {"bringSourcesUpToDate: Caught %@: %@", &kPassFailed, "--"},
 };
 
 const Line* lineOf(std::string_view format) {

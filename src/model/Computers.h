@@ -27,7 +27,7 @@ bool isOneOfSeveral(const Preferences& preferences);
 void becomeOneOfSeveral(Preferences& preferences);
 void becomeTheOnlyOne(Preferences& preferences);
 
-// What a computer of this person is known by. A copy of the preferences on another machine is another computer.
+// The marks of one of this person's computers. A copy of the preferences on another machine is another computer.
 struct Computer {
     std::string id;           // a random text
     std::string name;         // for people

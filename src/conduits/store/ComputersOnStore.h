@@ -25,7 +25,7 @@ public:
 
     // In the order of their identifiers; none where the tree has no such file. Nothing when that could not be learnt.
     std::optional<std::vector<Computer>> read();
-    // Puts the computer in the place of what the file says of it, and returns all. Nothing when that failed.
+    // Replaces the file's entry of the computer, and returns all entries. Nothing when that failed.
     std::optional<std::vector<Computer>> put(const Computer& computer);
     bool remove(const std::string& id); // true: it is not there
 

@@ -1,10 +1,11 @@
 #include "engine/pass/PassRefusals.h"
 
+#include "contacts/database/CXRolvane.h"
+#include "contacts/records/Constants.h"
 #include "contacts/records/Identifier.h"
 #include "engine/memory/PublicationCache.h"
 #include "engine/queue/ChangeQueue.h"
 #include "engine/queue/RefusedChanges.h"
-#include "engine/recovery/Holdings.h"
 #include "engine/recovery/UnderWay.h"
 #include "foundation/TestSwitch.h"
 #include "model/PayloadKeys.h"
@@ -12,6 +13,7 @@
 
 #include <algorithm>
 #include <optional>
+#include <string_view>
 #include <vector>
 
 namespace rolvane {
@@ -20,7 +22,7 @@ namespace {
 
 // News have taken contacts or groups away before the store said that they left this group, too. So they have left the
 // copy of the group, and nobody has edited that.
-bool isDeletionByNews(CXDChangeRecord& record, Holdings& holdings) {
+bool isDeletionByNews(CXDChangeRecord& record, CXRolvane& rolvane) {
     if (record.type() != CXDCompositeGroupChange || isListOfEverybody(record)) return false;
     const Dictionary payload = record.payload().dictionary();
     const auto isEmpty = [&](const char* part) {
@@ -30,11 +32,14 @@ bool isDeletionByNews(CXDChangeRecord& record, Holdings& holdings) {
     for (const char* part : {kMemberAdds, kSubgroupAdds, kDistributionListAdds, kCXGroupNameProperty})
         if (!isEmpty(part)) return false;
     const Array people = payload[kMemberRemoves].array(), groups = payload[kSubgroupRemoves].array();
+    const auto isGone = [&](const Value& name, std::string_view table) {
+        return !rolvane.recordForUniqueId(cxUIDWithTableName(UniqueId(name.string()), table));
+    };
     return (!people.empty() || !groups.empty()) &&
-           std::none_of(people.begin(), people.end(),
-                        [&](const Value& name) { return holdings.person(UniqueId(name.string())); }) &&
-           std::none_of(groups.begin(), groups.end(),
-                        [&](const Value& name) { return holdings.group(UniqueId(name.string())); });
+           std::all_of(people.begin(), people.end(),
+                       [&](const Value& name) { return isGone(name, kCXSubscribedPersonTable); }) &&
+           std::all_of(groups.begin(), groups.end(),
+                       [&](const Value& name) { return isGone(name, kCXSubscribedGroupTable); });
 }
 
 } // namespace
@@ -77,10 +82,9 @@ void PassRefusals::tell() {
 }
 
 std::vector<UserName> PassRefusals::ofCopies() const {
-    Holdings holdings(_parts.with.rolvane);
     std::vector<UserName> users;
     for (const CXDChangeRecordPtr& record : _parts.denied.all())
-        if (!isOwnWrite(*record) && !isDeletionByNews(*record, holdings))
+        if (!isOwnWrite(*record) && !isDeletionByNews(*record, _parts.with.rolvane))
             users.push_back(record->user().value_or(UserName()));
     return users;
 }

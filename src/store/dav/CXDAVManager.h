@@ -159,7 +159,7 @@ public:
     bool knowsPublishStructure() const;
     // The serial number that the account's own tree is known by; "" for none. A tree that has lost it gets it again.
     void keepSerialNumber(const std::string& serial);
-    // True: of the own tree only what is missing is made. One of which nothing is left stays away.
+    // True: missing parts of the own tree are made. A tree that is gone altogether is not made again.
     void mendOwnTreeOnly(bool mendOnly);
 
     // -- access lists (RFC 3744), as account names: who may read, and who may write. A name with the scheme https is

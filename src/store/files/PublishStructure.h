@@ -23,7 +23,7 @@ public:
     // What a lost "info" is to say again; "" for a new number. A tree that is made anew under its old number is filled
     // by its owner, and nobody takes it for another tree.
     void keepSerialNumber(std::string serial);
-    // True: a tree of which neither "info" nor "People" is left has been withdrawn by another computer of its owner,
+    // True: a tree that has lost both "info" and "People" has been withdrawn by another computer of its owner,
     // and is not made anew.
     void mendOnly(bool mendOnly) { _mendOnly = mendOnly; }
 
