@@ -82,6 +82,19 @@ TEST(LogEvents, EachKindHasATextInTheJournalsCatalog) {
     EXPECT_EQ(entries, logKinds().size());
 }
 
+TEST(LogEvents, FailuresAreWholeForEverybodyAndOtherLinesAreNot) {
+    const std::string told = "CX | CXDUpdateRecord | \"Zoe\" at https://dav.example.org/zoe";
+    for (const char* format : {"Exception with applying change record: %@", "Change record: %@",
+                               "Quitting due to an unhandled exception: %@", "Exception saving ACL: %@"}) {
+        const LogEvent event = logEvent(format, {{told}});
+        EXPECT_THAT(event.publicLine, testing::HasSubstr(told));
+        EXPECT_EQ(event.publicLine, event.line);
+    }
+    const LogEvent event = logEvent("The access list of %@ could not be set: %@", {{told}, {told}});
+    EXPECT_THAT(event.publicLine, testing::Not(testing::HasSubstr("Zoe")));
+    EXPECT_THAT(event.publicLine, testing::Not(testing::HasSubstr("/zoe")));
+}
+
 TEST(LogEvents, AReasonIsClearedOfWhatNamesSomebody) {
     const TempHome home;
     const std::map<std::string, std::string> expected{
