@@ -1,4 +1,5 @@
 #include "TestDatabase.h"
+#include "foundation/Sqlite.h"
 
 #include <algorithm>
 #include <gtest/gtest.h>
@@ -47,6 +48,34 @@ TEST_F(ReachedStoreTest, GoesWhenItIsForgottenAndWithItsRecord) {
     d->removeRecord(d->recordForUniqueId(ben));
     d->save();
     EXPECT_TRUE(d->reached().empty());
+}
+
+// A name without a file comes before the file, and never behind it.
+TEST_F(ReachedStoreTest, ANameWithoutAFileGivesWayToTheFile) {
+    const auto of = [&](const UniqueId& uid) {
+        for (const CXReached& each : d.open("rolvane")->reached())
+            if (each.uniqueId == uid) return each;
+        return CXReached{};
+    };
+    d->noteReachedAtOnce({{ada, kSelf, Date(1000), false}, {ben, kSelf, Date(1000), false}});
+    d->noteReachedAtOnce({{ada, kSelf, Date(2000), false}, {ben, kSelf, Date(3000)}});
+    EXPECT_FALSE(of(ada).hasFile);
+    EXPECT_EQ(of(ada).since, Date(1000)) << "it has had that name since then";
+    EXPECT_TRUE(of(ben).hasFile);
+    EXPECT_EQ(of(ben).since, Date(3000));
+    d->noteReachedAtOnce({{ben, kSelf, Date(4000), false}});
+    EXPECT_TRUE(of(ben).hasFile);
+}
+
+TEST_F(ReachedStoreTest, TakesUpTheTableOfAnEarlierVersion) {
+    Sqlite file(d.path, 1000);
+    file.execute("CREATE TABLE reached(record_id INTEGER PRIMARY KEY REFERENCES records(id) ON DELETE CASCADE,"
+                 " tree TEXT NOT NULL, since REAL NOT NULL);"
+                 "INSERT INTO reached SELECT id, 'self', 1000 FROM records WHERE uid='A:CXPerson'");
+    ASSERT_EQ(noted(*d.database), std::vector{ada});
+    EXPECT_TRUE(d->reached().front().hasFile);
+    d->noteReachedAtOnce({{ben, kSelf, Date(2000), false}});
+    EXPECT_EQ(noted(*d.open("rolvane")), (std::vector{ada, ben}));
 }
 
 } // namespace

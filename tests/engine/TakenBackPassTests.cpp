@@ -506,6 +506,89 @@ TEST_F(TakenBackPass, ANewGroupThatItsOwnerDeletesWithinTheWeekStaysDeleted) {
 }
 
 // Its name stood in the list for a week, its file never came, and the owner's daemon has taken the name out.
+TEST_F(TakenBackPass, ANewContactWhoseNameItsOwnerHasTakenForALeftoverIsWrittenAgain) {
+    const CXPersonRef dora = addToAlices("Dora");
+    const auto copy = std::dynamic_pointer_cast<CXGroup>(copyOf(friends, kCXSubscribedGroupTable));
+    copy->addMember(dora);
+    bob.application->save();
+    const UniqueId shared = cxNormalizedUID(dora->uniqueId());
+    leaveHalf(shared);
+    settle();
+    EXPECT_TRUE(isOnTheStore(shared)) << log.text();
+    EXPECT_EQ(alice.countPeople(), 4u);
+    EXPECT_EQ(friends->memberUniqueIds().size(), 3u);
+    EXPECT_TRUE(bob.application->recordForUniqueId(dora->uniqueId()));
+}
+
+// The name goes while the pass that is to write the file is under way.
+TEST_F(TakenBackPass, ANewContactWhoseNameIsTakenAwayBesideItsWriteIsWrittenAgain) {
+    const UniqueId shared = cxNormalizedUID(addToAlices("Dora")->uniqueId());
+    refuseFileOf(shared);
+    bob.pass();
+    alice.pass();
+    alice.clock.ahead = bob.clock.ahead = 8.0 * 86400;
+    bool taken = false;
+    bob.wire->intercept([&](const HttpRequest& request) -> std::optional<HttpResponse> {
+        const bool isFile = request.url.encodedPath().find(shared.str().substr(0, 36)) != std::string::npos;
+        if (isFile && !std::exchange(taken, true)) {
+            Dictionary list = contentOf(world->file("AllCXGroup")).mutableCopy();
+            list.arrayFor(kMemberUIDState).removeAll(shared);
+            rewrite(world->file("AllCXGroup"), PropertyList::toXML(list));
+        }
+        return std::nullopt;
+    });
+    bob.pass();
+    bob.wire->intercept({});
+    ASSERT_TRUE(taken);
+    settle();
+    EXPECT_TRUE(isOnTheStore(shared)) << log.text();
+    EXPECT_EQ(alice.countPeople(), 4u);
+}
+
+// Its file had come all the same, and the answer got lost.
+TEST_F(TakenBackPass, ANewContactThatItsOwnerDeletesStaysDeleted) {
+    for (const bool isRefusedForLong : {false, true}) {
+        const CXPersonRef dora = addToAlices("Dora");
+        const UniqueId shared = cxNormalizedUID(dora->uniqueId());
+        refuseFileOf(shared);
+        bob.pass();
+        if (!isRefusedForLong) bob.wire->intercept({});
+        rewrite(fileOf(shared), PropertyList::toXML(Dictionary{{kCXFirstNameProperty, "Dora"}}));
+        if (isRefusedForLong) {
+            dora->setValue(Value("met in Lyon"), kCXNoteProperty);
+            bob.application->save();
+            bob.pass(); // sees the file, and cannot write it
+        }
+        bob.wire->intercept({});
+        alice.pass();
+        const CXRecordRef taken = alice.application->recordForUniqueId(shared);
+        ASSERT_TRUE(taken) << log.text();
+        if (isRefusedForLong) bob.clock.ahead = alice.clock.ahead = 8.0 * 86400;
+        remove(alice, taken);
+        alice.pass();
+        settle();
+        EXPECT_FALSE(alice.application->recordForUniqueId(shared)) << isRefusedForLong << log.text();
+        EXPECT_FALSE(isOnTheStore(shared)) << isRefusedForLong;
+    }
+}
+
+// The file came with the second pass, and the contact was there for a week.
+TEST_F(TakenBackPass, AContactWhoseFileCameLaterAndThatItsOwnerDeletesAfterAWeekStaysDeleted) {
+    const UniqueId shared = cxNormalizedUID(addToAlices("Dora")->uniqueId());
+    refuseFileOf(shared);
+    bob.pass();
+    bob.wire->intercept({});
+    bob.pass();
+    ASSERT_TRUE(isOnTheStore(shared)) << log.text();
+    alice.pass();
+    alice.clock.ahead = bob.clock.ahead = 8.0 * 86400;
+    remove(alice, alice.application->recordForUniqueId(shared));
+    alice.pass();
+    settle();
+    EXPECT_FALSE(alice.application->recordForUniqueId(shared)) << log.text();
+    EXPECT_FALSE(isOnTheStore(shared));
+}
+
 TEST_F(TakenBackPass, ANewGroupWhoseNameItsOwnerHasTakenForALeftoverIsWrittenAgain) {
     const CXGroupRef circle = groupInAlices("Circle");
     circle->addMember(bob.copyOf(people[1]));

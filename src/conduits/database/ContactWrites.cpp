@@ -123,6 +123,10 @@ bool ContactWrites::writeWhereNoneIs(const Place& place, const Dictionary& ours,
             return false;
         }
         if (!members.array().containsString(cxNormalizedUID(place.uniqueId).str())) {
+            if (place.wasNeverThere) {
+                code = 0; // the next look at the tree names it again
+                return false;
+            }
             CXLog("%@ has been deleted by somebody else, and is not written any more", place.location);
             _manager.forgetVersion(place.location);
             return true;

@@ -57,6 +57,7 @@ public:
         Url base;          // of the tree
         std::function<bool()>
             wasListed; // whether the list of everybody is known to have named the contact; asked at most once
+        bool wasNeverThere = false; // no store has had its file, so nobody can have deleted it: its change waits
     };
     // True when the store has the content afterwards, alone or merged, and when somebody else has deleted the contact:
     // its file is gone and the list that named it does not any more. `code`: the last answer's status; 412 when

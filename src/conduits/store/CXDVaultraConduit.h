@@ -163,10 +163,12 @@ private:
     bool allGroupHas(const char* property);
     void compareUnlistedGroups(CXDChangeRecords& records);
     void nameAgain(CXDChangeRecords& records);
-    bool wasNeverThere(const UserName& user, const UniqueId& group);
+    bool wasNeverThere(const UserName& user, const UniqueId& name);
     void compareWhatHadCome(CXDChangeRecords& records);
     std::vector<CXReached> whatHadCome();
     void forgetWhatIsKnown();
+    void forgetWhatHasAFile();
+    void forgetReached(const std::vector<UniqueId>& records);
     void leaveUnlistedOut(CXDChangeRecords& records);
     void forgetSubscribersRights();
     void noteUnsavedAccessLists();

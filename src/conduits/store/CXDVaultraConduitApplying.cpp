@@ -110,7 +110,7 @@ bool CXDVaultraConduit::apply(CXDChangeRecord& record, int& code) {
 
 void CXDVaultraConduit::willWrite(const CXDChangeRecords& records) {
     _writes.beginPass();
-    _newOnStore.beginPass();
+    _newOnStore.beginPass(_newRecords);
     _inDoubt.clear();
     for (const CXReached& each : whatHadCome())
         if (!_lookedFor.contains(each.uniqueId)) _inDoubt.insert(each.uniqueId);
@@ -153,9 +153,11 @@ bool CXDVaultraConduit::updateRecord(CXDChangeRecord& record, int& code) {
         user, layout::contactLocation(*base, *record.person()), inDatabase(record), mergesInto(user), *base, [&] {
             const Dictionary list = engine().knownGroupState(kConduitVaultra, user, everybody);
             return list[kMemberUIDState].array().containsString(shared.str());
-        }};
+        },
+        _newOnStore.isNamedAlone(inDatabase(record))};
     if (_inDoubt.contains(place.uniqueId) || !_writes.write(place, contentOf(record), code)) return false;
-    if (_newRecords.contains(place.uniqueId)) _newOnStore.wasPut(user, place.uniqueId, _world.clock.now());
+    if (place.wasNeverThere || _newRecords.contains(place.uniqueId))
+        _newOnStore.wasPut(user, place.uniqueId, _world.clock.now());
     return true;
 }
 

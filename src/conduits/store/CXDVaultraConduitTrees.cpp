@@ -235,6 +235,7 @@ CXDChangeRecords CXDVaultraConduit::changeRecords() {
     for (const CXDChangeRecordPtr& record : records)
         if (record->user()) changed.insert(*record->user());
     leaveUnlistedOut(records);
+    forgetWhatHasAFile();
     nameAgain(records);
     compareUnlistedGroups(records);
     compareWhatHadCome(records);
@@ -301,43 +302,61 @@ void CXDVaultraConduit::compareWhatHadCome(CXDChangeRecords& records) {
     }
 }
 
-// A new group's name comes into the list of everybody before its file. When the file does not follow within a week, the
-// owner's daemon takes the name for a leftover and removes it from all lists. Nobody ever had such a group, so it was
-// not deleted: its maker's daemon, which still has the file to write, writes the names again.
+// A name may come into the list of everybody before its file. When the file does not follow within a week, the owner's
+// daemon takes the name for a leftover and removes it from all lists. Nobody ever had such a record, so it was not
+// deleted: its maker's daemon, which still has the file to write, writes the names again.
 void CXDVaultraConduit::nameAgain(CXDChangeRecords& records) {
     if (isLeftOut("named again")) return;
-    std::set<std::pair<UserName, UniqueId>> taken;
     const auto isRemoval = [](const CXDChangeRecord& record) {
-        return record.type() == CXDRemoveGroupFromGroup && record.user() && record.person() && record.group();
+        return (record.type() == CXDRemoveRecordFromGroup || record.type() == CXDRemoveGroupFromGroup) &&
+               record.user() && record.person() && record.group();
     };
+    std::set<std::pair<UserName, UniqueId>> taken;
     for (const CXDChangeRecordPtr& record : records)
         if (isRemoval(*record) && record->group()->str() == layout::kAllGroup &&
             wasNeverThere(*record->user(), *record->person()))
             taken.emplace(*record->user(), *record->person());
     if (taken.empty()) return;
     Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
+    CXDChangeRecords choices;
     for (CXDChangeRecordPtr& record : records) {
         if (!isRemoval(*record) || !taken.contains({*record->user(), *record->person()})) continue;
-        users.dictionaryFor(record->user()->str())
-            .dictionaryFor(cxUIDWithTableName(*record->group(), kCXGroupTable).str())
-            .arrayFor(kSubgroupUIDState)
-            .removeAll(*record->person());
+        const auto again = [&](CXDChangeType type, const Value& payload = {}) {
+            auto change = std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, type, record->user(), record->person(),
+                                                            record->group(), payload);
+            change->setAppliesToSources(conduitSource());
+            return change;
+        };
+        const bool isGroup = record->type() == CXDRemoveGroupFromGroup;
+        Dictionary known = users.dictionaryFor(record->user()->str())
+                               .dictionaryFor(cxUIDWithTableName(*record->group(), kCXGroupTable).str());
+        known.arrayFor(isGroup ? kSubgroupUIDState : kMemberUIDState).removeAll(*record->person());
+        if (const Value& choice = known[kDistributionListState].dictionary()[record->person()->str()])
+            choices.push_back(again(CXDUpdateDistributionList, choice));
         CXDLog("It never came to the store, and is named there again: %@", record->description());
-        record = std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, CXDAddGroupToGroup, record->user(),
-                                                   record->person(), record->group());
-        record->setAppliesToSources(conduitSource());
+        record = again(isGroup ? CXDAddGroupToGroup : CXDAddRecordToGroup);
     }
+    records.insert(records.end(), choices.begin(), choices.end());
 }
 
-// No file of the group is known to have been on somebody else's store, and a leftover's time is over for it.
-bool CXDVaultraConduit::wasNeverThere(const UserName& user, const UniqueId& group) {
-    if (user == kSelf || !mergesInto(user)) return false;
-    const CXRecordRef record = _world.rolvane.recordForUniqueId(nameInDatabase(user, group));
+// No file of it is known to have been on the store, and a leftover's time is over for it. The file of a contact comes
+// before its name, so a name without a file is noted. A group's comes later, and the states tell of it.
+bool CXDVaultraConduit::wasNeverThere(const UserName& user, const UniqueId& name) {
+    if (!mergesInto(user)) return false;
+    const UniqueId here = nameInDatabase(user, name);
+    const CXRecordRef record = _world.rolvane.recordForUniqueId(here);
     if (!record) return false;
+    const auto isOver = [&](const Date& since) { return _world.clock.now().secondsSince(since) >= kPatience; };
+    if (!name.endsWith(kCXGroupTable)) {
+        const std::vector<CXReached> noted = _world.rolvane.reached();
+        return std::any_of(noted.begin(), noted.end(), [&](const CXReached& each) {
+            return each.uniqueId == here && each.tree == user && !each.hasFile && isOver(each.since);
+        });
+    }
     const auto made = record->valueForProperty(kCXCreationDateProperty).date();
-    if (!made || _world.clock.now().secondsSince(*made) < kPatience) return false;
+    if (user == kSelf || !made || !isOver(*made)) return false;
     const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
-    return users[user.str()].dictionary()[group.str()].dictionary().empty();
+    return users[user.str()].dictionary()[name.str()].dictionary().empty();
 }
 
 // Without those that the states know by now, and those that a leftover's time is over for.
@@ -347,7 +366,7 @@ std::vector<CXReached> CXDVaultraConduit::whatHadCome() {
     const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
     std::map<UserName, ListedRecords> known;
     std::erase_if(reached, [&](const CXReached& each) {
-        return _world.clock.now().secondsSince(each.since) >= kPatience ||
+        return !each.hasFile || _world.clock.now().secondsSince(each.since) >= kPatience ||
                known.try_emplace(each.tree, users[each.tree.str()].dictionary()).first->second.contains(each.uniqueId);
     });
     return reached;
@@ -360,9 +379,25 @@ void CXDVaultraConduit::forgetWhatIsKnown() {
     for (const CXReached& each : whatHadCome()) unknown.insert(each.uniqueId);
     std::vector<UniqueId> needless;
     for (const CXReached& each : reached)
-        if (!unknown.contains(each.uniqueId)) needless.push_back(each.uniqueId);
+        if (each.hasFile && !unknown.contains(each.uniqueId)) needless.push_back(each.uniqueId);
+    forgetReached(needless);
+}
+
+// Names that were noted as without a file, where the trees that were read have one.
+void CXDVaultraConduit::forgetWhatHasAFile() {
+    if (isLeftOut("files that came")) return;
+    std::vector<UniqueId> needless;
+    for (const CXReached& each : _world.rolvane.reached())
+        if (const auto read = _read.find(each.tree); !each.hasFile && read != _read.end())
+            if (read->second[kPeopleState].dictionary()[kMemberUIDState].dictionary().contains(
+                    cxNormalizedUID(each.uniqueId).str()))
+                needless.push_back(each.uniqueId);
+    forgetReached(needless);
+}
+
+void CXDVaultraConduit::forgetReached(const std::vector<UniqueId>& records) {
     try {
-        _world.rolvane.forgetReached(needless);
+        _world.rolvane.forgetReached(records);
     } catch (const CXException& exception) {
         CXLog("Notes of new records are kept until the next pass: %@", exception);
     }

@@ -13,12 +13,16 @@ namespace rolvane {
 // killed would otherwise be made again, and bring the record back.
 //
 // A contact's file comes before its name, and the note is durable before the name is written. A group's file follows
-// its name; a process that is killed between that file and its note leaves none. Any thread.
+// its name; a process that is killed between that file and its note leaves none.
+//
+// A contact may be named though the store has refused its file. The note of that name is durable, too: it tells that
+// the contact was never there, and nobody can have deleted it. Any thread.
 class NewOnStore {
 public:
     explicit NewOnStore(CXRolvane& rolvane) : _rolvane(rolvane) {} // borrowed
 
-    void beginPass(); // of names alone nothing is known any more
+    // On the main thread. `newRecords`: those that this pass is to put there, as the database names them; borrowed.
+    void beginPass(const std::unordered_set<UniqueId>& newRecords);
     // The store has the new record's file. `record`: as the database names it; `tree`: whose it is.
     void wasPut(const UserName& tree, const UniqueId& record, Date now);
     // The list of everybody is about to name them. Throws CXException where the note cannot be stored.
@@ -28,14 +32,17 @@ public:
     // lost.
     void listWaits(const std::vector<UniqueId>& records);
     bool waitsForList(const UniqueId& record); // in this pass
+    bool isNamedAlone(const UniqueId& contact); // its file is not known to have come
 
 private:
     void note(const std::vector<CXReached>& reached);
 
     CXRolvane& _rolvane;
+    const std::unordered_set<UniqueId>* _newRecords = nullptr;
     std::mutex _lock;
     std::unordered_set<UniqueId> _put;     // without a name, of all passes of this process; guarded by _lock
     std::unordered_set<UniqueId> _named;   // without a file, of this pass; guarded by _lock
+    std::unordered_set<UniqueId> _alone;   // contacts without a file, of all passes; guarded by _lock
     std::unordered_set<UniqueId> _waiting; // for the list, in this pass; guarded by _lock
 };
 

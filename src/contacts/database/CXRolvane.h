@@ -192,8 +192,8 @@ public:
     // version is set, whatever becomes of the process. Part of the unit of work. Any thread.
     void setSentVersion(const UniqueId& uid, std::shared_ptr<const Bytes> properties);
     std::vector<UniqueId> editedSinceCommon(); // contacts with edits that were not sent, oldest first
-    // New records that a store has now, whatever becomes of the pass that put them there. Durable on return; of records
-    // that are saved. Any thread.
+    // New records that a store has now, or names in its lists, whatever becomes of the pass that put them there.
+    // Durable on return; of records that are saved. Any thread.
     void noteReachedAtOnce(const std::vector<CXReached>& reached);
     std::vector<CXReached> reached();
     void forgetReached(const std::vector<UniqueId>& records); // durable on return
