@@ -2,9 +2,11 @@
 
 #include "server/mod_davacl/Access.h"
 #include "server/mod_davacl/News.h"
+#include "server/mod_davacl/QuotaTurn.h"
 
 #include <cerrno>
 #include <cstring>
+#include <memory>
 #include <new>
 
 namespace rolvane::davacl {
@@ -18,6 +20,9 @@ struct Change {
     const Configuration* c = nullptr;
     std::optional<TreePath> source, destination; // each only when it is below the base
     std::vector<Need> sourceNeeds, destinationNeeds;
+    std::optional<QuotaTurn::Place> destinationOnDisk;
+    std::unique_ptr<QuotaTurn> quota; // null until the handler may begin
+    uint64_t received = 0;            // bytes of the body so far
 };
 
 apr_status_t destroyChange(void* change) {
@@ -99,11 +104,11 @@ bool endsHere(apr_bucket_brigade* brigade) {
 }
 
 // An error bucket makes httpd answer with the status, whatever the handler that was reading makes of it.
-apr_status_t stopReading(ap_filter_t* filter) {
+apr_status_t stopReading(ap_filter_t* filter, int status) {
     request_rec* r = filter->r;
     apr_bucket_alloc_t* allocator = r->connection->bucket_alloc;
     apr_bucket_brigade* brigade = apr_brigade_create(r->pool, allocator);
-    APR_BRIGADE_INSERT_TAIL(brigade, ap_bucket_error_create(HTTP_FORBIDDEN, nullptr, r->pool, allocator));
+    APR_BRIGADE_INSERT_TAIL(brigade, ap_bucket_error_create(status, nullptr, r->pool, allocator));
     APR_BRIGADE_INSERT_TAIL(brigade, apr_bucket_eos_create(allocator));
     ap_remove_input_filter(filter);
     ap_pass_brigade(r->output_filters, brigade);
@@ -113,15 +118,26 @@ apr_status_t stopReading(ap_filter_t* filter) {
 apr_status_t readLastByte(ap_filter_t* filter, apr_bucket_brigade* brigade, ap_input_mode_t mode, apr_read_type_e block,
                           apr_off_t wanted) noexcept {
     const apr_status_t status = ap_get_brigade(filter->next, brigade, mode, block, wanted);
-    if (status != APR_SUCCESS || !endsHere(brigade)) return status;
+    if (status != APR_SUCCESS || mode != AP_MODE_READBYTES) return status;
+    auto& change = *static_cast<Change*>(filter->ctx);
+    apr_off_t bytes = 0;
+    if (apr_brigade_length(brigade, 1, &bytes) == APR_SUCCESS && bytes > 0)
+        change.received += static_cast<uint64_t>(bytes);
+    if (!endsHere(brigade)) {
+        if (change.quota->allows(change.received)) return status;
+        apr_brigade_cleanup(brigade);
+        filter->r->connection->keepalive = AP_CONN_CLOSE; // the rest of the body is not read
+        return stopReading(filter, HTTP_INSUFFICIENT_STORAGE);
+    }
     return contained(filter->r, static_cast<apr_status_t>(APR_EGENERAL), [&]() -> apr_status_t {
-        const auto& change = *static_cast<const Change*>(filter->ctx);
-        if (!hold(filter->r, change)) {
+        const bool refused = hold(filter->r, change).has_value();
+        if (!refused && change.quota->begin(change.received)) {
             ap_remove_input_filter(filter);
             return APR_SUCCESS;
         }
+        stateOf(filter->r).guards.clear();
         apr_brigade_cleanup(brigade);
-        return stopReading(filter);
+        return stopReading(filter, refused ? HTTP_FORBIDDEN : HTTP_INSUFFICIENT_STORAGE);
     });
 }
 
@@ -147,7 +163,8 @@ apr_status_t beforeAnswer(ap_filter_t* filter, apr_bucket_brigade* brigade) noex
     request_rec* r = filter->r;
     ap_filter_t* next = filter->next;
     contained(r, false, [&] {
-        const auto& change = *static_cast<const Change*>(filter->ctx);
+        auto& change = *static_cast<Change*>(filter->ctx);
+        change.quota->end();
         stateOf(r).guards.clear();
         // 207: something was left, and the place with it.
         const bool done = r->status >= 200 && r->status < 300;
@@ -184,6 +201,7 @@ int lookAtDestination(request_rec* r, Change& change) {
     }
     change.destination = TreePath::of(change.c->base, found.rnew->uri);
     change.destinationNeeds = needsOfDestination(r->method, standingOf(found.rnew));
+    change.destinationOnDisk = quotaPlaceOf(found.rnew, change.destination);
     // mod_dav would remove what is there first, and the source with it.
     if (change.source && change.destination && change.source->isWithin(*change.destination))
         return dav_handle_err(
@@ -214,14 +232,19 @@ int prepare(request_rec* r) {
     // section 14.5 lets a server refuse it).
     if (is(r, "PUT") && apr_table_get(r->headers_in, "Content-Range"))
         return badRequest(r, "PUT with Content-Range is not supported here. Send the whole file.");
+    change->quota =
+        std::make_unique<QuotaTurn>(r, *c, quotaPlaceOf(r, change->source), std::move(change->destinationOnDisk));
+    if (!change->quota->mayBegin()) return refuseForRoom(r);
     if (is(r, "MKCOL") && !stands(r)) dropLists(r, *change, *change->source);
     ap_add_output_filter(kAnswer, change, r, r->connection);
     if (ap_request_has_body(r)) {
         ap_add_input_filter(kLastByte, change, r, r->connection);
         return DECLINED;
     }
-    const auto missing = hold(r, *change);
-    return missing ? refuse(r, *c, *missing) : DECLINED;
+    if (const auto missing = hold(r, *change)) return refuse(r, *c, *missing);
+    if (change->quota->begin(0)) return DECLINED;
+    stateOf(r).guards.clear();
+    return refuseForRoom(r);
 }
 
 } // namespace

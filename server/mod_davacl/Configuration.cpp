@@ -3,6 +3,7 @@
 #include "server/mod_davacl/Confinement.h"
 #include "server/mod_davacl/News.h"
 #include "server/mod_davacl/Passwords.h"
+#include "server/mod_davacl/QuotaTurn.h"
 #include "server/mod_davacl/TreeDirectories.h"
 #include "server/mod_davacl/TreePath.h"
 
@@ -161,6 +162,20 @@ const char* setNewsOfUser(cmd_parms* cmd, void*, const char* text) {
                : "the number of requests that wait must be from 1 to 10000";
 }
 
+const char* setQuota(cmd_parms* cmd, void*, const char* text) {
+    const auto size = sizeOf(text);
+    if (!size) return "the quota must be a number of bytes, such as 1048576, 500M or 2G, or none";
+    ofServer(cmd->server)->quota = *size;
+    ofServer(cmd->server)->hasQuota = true;
+    return nullptr;
+}
+
+const char* setQuotaFile(cmd_parms* cmd, void*, const char* path) {
+    Configuration* c = ofServer(cmd->server);
+    c->quotaFile = ap_server_root_relative(cmd->pool, path);
+    return c->quotaFile ? nullptr : "the argument must be the path of a file of quotas";
+}
+
 const char* setHeartbeat(cmd_parms* cmd, void*, const char* text) {
     return readNumber(text, 60, ofServer(cmd->server)->heartbeat) ? nullptr
                                                                   : "the heartbeat must be from 1 to 60 seconds";
@@ -180,8 +195,9 @@ bool isWithin(const char* path, const char* directory) {
 const char* complaintAbout(const server_rec* server) {
     const Configuration* c = ofServer(server);
     if (!c->base) {
-        if (c->principals || c->groupFile || c->users || c->depth || c->entries)
-            return "DavAclPrincipals, DavAclGroupFile, DavAclUsers, DavAclDepth and DavAclMaxEntries need a "
+        if (c->principals || c->groupFile || c->users || c->depth || c->entries || c->keepsQuotas())
+            return "DavAclPrincipals, DavAclGroupFile, DavAclUsers, DavAclDepth, DavAclMaxEntries and DavAclQuota need "
+                   "a "
                    "DavAclBase";
         return nullptr;
     }
@@ -287,6 +303,9 @@ void* mergeConfigurations(apr_pool_t* pool, void* base, void* more) {
     if (inner->newsOfUser) merged->newsOfUser = inner->newsOfUser;
     if (inner->heartbeat) merged->heartbeat = inner->heartbeat;
     if (inner->depth) merged->depth = inner->depth;
+    if (inner->hasQuota) merged->quota = inner->quota;
+    merged->hasQuota = outer->hasQuota || inner->hasQuota;
+    if (inner->quotaFile) merged->quotaFile = inner->quotaFile;
     if (inner->entries) merged->entries = inner->entries;
     return merged;
 }
@@ -343,6 +362,7 @@ int checkConfigurations(apr_pool_t* pool, apr_pool_t*, apr_pool_t* temporary, se
     const char* complaint = prepareConfinement(pool, temporary, main);
     if (!complaint) complaint = preparePasswords(pool);
     if (!complaint) complaint = prepareNews(main);
+    prepareQuotas();
     bool strict = complaint;
     if (!complaint) complaint = findDirectories(pool, main);
     for (const server_rec* each = main; each; each = each->next) {
@@ -390,6 +410,10 @@ const command_rec kDirectives[] = {
      "after how many seconds without news a waiting request gets a line all the same: 45 by default"},
     {"DavAclMaxEntries", asCommand(setMaxEntries), nullptr, RSRC_CONF, TAKE1,
      "how many entries a list may hold: 1000 by default"},
+    {"DavAclQuota", asCommand(setQuota), nullptr, RSRC_CONF, TAKE1,
+     "how many bytes each owner's tree may take: 500M, 2G, or none"},
+    {"DavAclQuotaFile", asCommand(setQuotaFile), nullptr, RSRC_CONF, TAKE1,
+     "a file with a line for each user who may have another quota: the name, a colon, and the size"},
     {"DavAclDepth", asCommand(setDepth), nullptr, RSRC_CONF, TAKE1,
      "how many segments below the base may have lists of their own: 2 by default"},
     {nullptr, nullptr, nullptr, 0, RAW_ARGS, nullptr}};

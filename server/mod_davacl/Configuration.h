@@ -1,6 +1,7 @@
 #pragma once
 
 #include "server/mod_davacl/Httpd.h"
+#include "server/mod_davacl/Quota.h"
 
 namespace rolvane::davacl {
 
@@ -24,9 +25,13 @@ struct Configuration {
     int news = -1;                       // whether readers may wait for news; -1: not said
     int newsOfUser = 0;                  // the most waiting requests of one user in a process; 0: not said
     int heartbeat = 0;                   // seconds between two lines; 0: not said
+    uint64_t quota = kNoQuota;           // bytes that each owner's tree may take
+    const char* quotaFile = nullptr;     // users' own quotas; null: none
+    bool hasQuota = false;               // whether `quota` was said
     int depth = 0;                       // how many segments below the base may have lists of their own
 
     bool isStrict() const { return strict != 0; }
+    bool keepsQuotas() const { return hasQuota || quotaFile; }
     const char* principalBase() const { return principals ? principals : "/principals"; }
     size_t mostEntries() const { return entries ? static_cast<size_t>(entries) : 1000; }
     size_t levels() const { return depth ? static_cast<size_t>(depth) : 2; }

@@ -4,6 +4,7 @@
 #include "server/mod_davacl/MembersTag.h"
 #include "server/mod_davacl/News.h"
 #include "server/mod_davacl/PrincipalResources.h"
+#include "server/mod_davacl/QuotaTurn.h"
 #include "server/mod_davacl/ReportBody.h"
 #include "server/mod_davacl/Reports.h"
 #include "server/mod_davacl/SyncCollection.h"
@@ -25,7 +26,9 @@ enum Property {
     kCurrentUserPrincipal,
     kSupportedReportSet,
     kSyncToken,
-    kMembersTag
+    kMembersTag,
+    kQuotaUsed,
+    kQuotaAvailable
 };
 const char* const kNamespaces[] = {"DAV:", kOwnNamespace, nullptr};
 constexpr int kOwn = 1; // the place of kOwnNamespace there
@@ -39,6 +42,8 @@ const dav_liveprop_spec kProperties[] = {{0, "owner", kOwner, 0},
                                          {0, "current-user-principal", kCurrentUserPrincipal, 0},
                                          {0, "supported-report-set", kSupportedReportSet, 0},
                                          {0, "sync-token", kSyncToken, 0},
+                                         {0, "quota-used-bytes", kQuotaUsed, 0},
+                                         {0, "quota-available-bytes", kQuotaAvailable, 0},
                                          {kOwn, kMembersTagName, kMembersTag, 0},
                                          {0, nullptr, 0, 0}};
 
@@ -119,6 +124,19 @@ std::optional<std::string> tagOf(const Asked& a, const dav_resource* resource) {
     return directory ? membersTag(*directory, int64_t{now.tv_sec} * 1000000000 + now.tv_nsec) : std::nullopt;
 }
 
+// RFC 4331, for whoever may put something there: how much a tree holds concerns nobody else.
+std::optional<std::string> quotaOf(const Asked& a, int property, const dav_resource* resource) {
+    if (!a.c.keepsQuotas() || a.place.isBase() || !resource->collection || !resource->exists ||
+        !(privilegesOn(a.r, a.c, a.place) & kBind))
+        return std::nullopt;
+    const auto directory = directoryOf(a.r, resource);
+    if (!directory) return std::nullopt;
+    const auto figures = quotaFiguresOf(a.r, a.c, {a.place, *directory, true});
+    if (!figures) return std::nullopt;
+    if (property == kQuotaUsed) return std::to_string(figures->used);
+    return figures->available ? std::optional(std::to_string(*figures->available)) : std::nullopt;
+}
+
 // Nothing: not defined there, or not for this user.
 std::optional<std::string> valueOf(const Asked& a, int property, const dav_resource* resource) {
     const unsigned mine = privilegesOn(a.r, a.c, a.place);
@@ -142,6 +160,8 @@ std::optional<std::string> valueOf(const Asked& a, int property, const dav_resou
         return supportedReports(true, canSynchronize(a.r, resource)) +
                (tellsNews(a.r) ? newsReportElement() : std::string());
     case kCurrentUserPrincipal: return currentUserPrincipal(a.r, a.c);
+    case kQuotaUsed:
+    case kQuotaAvailable: return quotaOf(a, property, resource);
     default: return std::nullopt;
     }
 }
@@ -154,6 +174,8 @@ dav_prop_insert insertProperty(const dav_resource* resource, int property, dav_p
         const Configuration* c = configurationOf(r);
         const auto place = c && resource->uri ? TreePath::of(c->base, resource->uri) : std::nullopt;
         if (!place) return DAV_PROP_INSERT_NOTDEF;
+        const bool ofQuota = property == kQuotaUsed || property == kQuotaAvailable;
+        if (ofQuota && (!c->keepsQuotas() || !resource->collection)) return DAV_PROP_INSERT_NOTDEF;
         const dav_liveprop_spec* spec = nullptr;
         dav_get_liveprop_info(property, &kLiveProperties, &spec);
         const bool own = spec->ns == kOwn;
