@@ -117,6 +117,18 @@ void HttpdLauncher::launch(const StoreIdentity& identity, int port, bool tls,
     }
 }
 
+std::string HttpdLauncher::complaint(const StoreIdentity& identity) const {
+    const std::string output = _service.stateDirectory + "/check.log";
+    const StoreProcess process = StoreProcess::launch(
+        {_service.program, "-d", _service.stateDirectory, "-f", configurationFile(), "-t"}, identity, output);
+    const bool ended = process.waitForExit(kStartDeadline);
+    if (!ended) process.signal(SIGKILL);
+    std::string said = textOfServersFile(output, kLongestExplanation);
+    if (ended && said.find("Syntax OK") != std::string::npos) said.clear();
+    unlink(output.c_str());
+    return said.empty() && !ended ? "It did not look at its configuration within 10 seconds." : said;
+}
+
 // httpd writes its pid file when it listens, and answers when a worker has come up.
 void HttpdLauncher::waitUntilReady(const StoreProcess& process, int port, bool tls, size_t logStart) const {
     const DirectoryWatch watch(_service.stateDirectory + "/run");

@@ -35,6 +35,9 @@ public:
     // Of this process's environment it knows only what StoreProcess::launch says, and the given variables.
     void launch(const StoreIdentity& identity, int port, bool tls, const std::vector<std::string>& environment) const;
 
+    // httpd's own words about its configuration; "" when it would start with it.
+    std::string complaint(const StoreIdentity& identity) const;
+
     enum class Stop { gracefully, atOnce };
     void stop(Stop how) const; // returns when the process is gone; nothing when it does not run
 

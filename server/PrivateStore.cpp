@@ -3,6 +3,7 @@
 #include "foundation/CXException.h"
 #include "foundation/Paths.h"
 #include "foundation/PropertyList.h"
+#include "foundation/Url.h"
 #include "server/HttpdLauncher.h"
 #include "server/LoopbackPort.h"
 #include "server/PasswordFile.h"
@@ -11,7 +12,11 @@
 #include "server/StorePlaces.h"
 #include "server/StoreProcess.h"
 
+#include <csignal>
+#include <cstdlib>
 #include <filesystem>
+#include <map>
+#include <sstream>
 #include <unistd.h>
 
 namespace rolvane {
@@ -50,6 +55,11 @@ struct PrivateStore::Implementation {
         return HttpdLauncher({"The store", state, options.httpdProgram, options.httpdModules});
     }
     std::string settingsFile() const { return state + "/store.plist"; }
+    std::string quotasFile() const { return state + "/conf/quotas"; }
+    std::map<std::string, std::string> quotas() const;
+    std::string shownCertificate() const;
+    std::string urlBy(const std::string& host) const;
+    void checkCertificate() const;
     std::string davDirectory() const { return options.documentRoot + "/dav"; }
     StoreCertificates certificates() const {
         return StoreCertificates(state + "/tls", StorePlaces::fileMode(StoreIdentity::choose()));
@@ -73,7 +83,42 @@ struct PrivateStore::Implementation {
     void usersChanged(bool wasRunning);
 };
 
+std::map<std::string, std::string> PrivateStore::Implementation::quotas() const {
+    std::map<std::string, std::string> all;
+    if (!exists(quotasFile())) return all;
+    std::istringstream lines(readFile(quotasFile()));
+    for (std::string line; std::getline(lines, line);)
+        if (const size_t colon = line.find(": "); colon != std::string::npos)
+            all[line.substr(0, colon)] = line.substr(colon + 2);
+    return all;
+}
+
+std::string PrivateStore::Implementation::shownCertificate() const {
+    if (!options.certificate.empty()) return options.certificate;
+    if (options.acmeDirectory.empty()) return certificates().certificateFile();
+    const std::string fetched = state + "/md/domains/" + options.name + "/pubcert.pem";
+    return exists(fetched) ? fetched : "";
+}
+
+std::string PrivateStore::Implementation::urlBy(const std::string& host) const {
+    const int port = savedPort();
+    if (port == 0) fail("The store in " + state + " has never been started. Start it with: rolvane store start");
+    const bool isUsual = options.tls && port == 443;
+    return (options.tls ? "https://" : "http://") + host + (isUsual ? "" : ":" + std::to_string(port)) + "/dav";
+}
+
+void PrivateStore::Implementation::checkCertificate() const {
+    if (options.certificate.empty()) return;
+    const std::string problem = certificateProblem(options.certificate, options.certificateKey);
+    if (!problem.empty())
+        fail(problem + " The store's user has to be able to read both files. Mend that, and start the store again.");
+}
+
 void PrivateStore::Implementation::makeDirectories() const {
+    if (!options.acmeDirectory.empty() && StoreIdentity::choose().change)
+        fail("A store with a certificate of ACME does not run as root's. Start it as a user of its own; the package "
+             "rolvane-store has one.");
+    if (!options.acmeDirectory.empty()) CXPathUtils_MakeCompletePath(state + "/md", 0700);
     StorePlaces(state, options.documentRoot, StoreIdentity::choose()).make();
 }
 
@@ -90,7 +135,8 @@ StoreIdentity PrivateStore::Implementation::identityFor() const {
 }
 
 void PrivateStore::Implementation::writeConfiguration(int port) {
-    if (options.tls) certificates().ensure(options.hosts, options.certificateLifetime);
+    if (options.tls && options.certificate.empty() && options.acmeDirectory.empty())
+        certificates().ensure(options.hosts, options.certificateLifetime);
     const std::string form =
         readFile(options.configurationTemplate.empty() ? storeTemplatePath() : options.configurationTemplate);
     const mode_t mode = StorePlaces::fileMode(StoreIdentity::choose());
@@ -126,7 +172,10 @@ void PrivateStore::Implementation::makeTrees(const StoreIdentity& identity) cons
 
 void PrivateStore::Implementation::startLocked() {
     if (launcher().running()) return;
-    launcher().checkProgram({"mod_mpm_event.so", "mod_dav.so", "mod_dav_fs.so"});
+    std::vector<std::string> modules{"mod_mpm_event.so", "mod_dav.so", "mod_dav_fs.so"};
+    if (!options.acmeDirectory.empty()) modules.emplace_back("mod_md.so");
+    launcher().checkProgram(modules);
+    checkCertificate();
     checkDigests();
     launcher().endOrphans();
     const StoreIdentity identity = identityFor();
@@ -194,6 +243,30 @@ void PrivateStore::start() {
     _implementation->startLocked();
 }
 
+bool PrivateStore::reload() {
+    if (!exists(_implementation->settingsFile())) return false;
+    _implementation->makeDirectories();
+    const HttpdLauncher launcher = _implementation->launcher();
+    const FileHandle lock = launcher.lock();
+    const auto process = launcher.running();
+    if (!process) return false;
+    const int port = _implementation->savedPort();
+    if (_implementation->options.port && _implementation->options.port != port)
+        fail("The store listens on port " + std::to_string(port) +
+             ", and another one needs a new start. Stop the store and start it again.");
+    _implementation->checkCertificate();
+    const std::string former = readFile(launcher.configurationFile());
+    const std::string formerSettings = readFile(_implementation->settingsFile());
+    _implementation->writeConfiguration(port);
+    if (const std::string complaint = launcher.complaint(_implementation->identityFor()); !complaint.empty()) {
+        writeFileDurably(launcher.configurationFile(), former, StorePlaces::fileMode(StoreIdentity::choose()));
+        writeFileDurably(_implementation->settingsFile(), formerSettings);
+        fail("The store goes on as before: httpd does not take the new configuration. It said:\n" + complaint);
+    }
+    process->signal(SIGUSR1);
+    return true;
+}
+
 void PrivateStore::stop(Stop how) {
     if (!exists(_implementation->settingsFile())) return;
     _implementation->makeDirectories();
@@ -257,12 +330,55 @@ std::string PrivateStore::errorLog() const {
     return _implementation->launcher().errorLog();
 }
 
+void PrivateStore::setQuota(const std::string& user, const std::string& quota) {
+    _implementation->makeDirectories();
+    const FileHandle lock = _implementation->launcher().lock();
+    auto all = _implementation->quotas();
+    all.erase(user);
+    if (!quota.empty()) all[user] = quota;
+    std::string text;
+    for (const auto& [name, size] : all) text.append(name).append(": ").append(size).append("\n");
+    writeFileDurably(_implementation->quotasFile(), text, StorePlaces::fileMode(StoreIdentity::choose()));
+}
+
+PrivateStore::Room PrivateStore::roomOf(const std::string& user) const {
+    Room room;
+    if (_implementation->options.quota.empty()) return room;
+    const auto all = _implementation->quotas();
+    room.isOwn = all.contains(user);
+    room.quota = room.isOwn ? all.at(user) : _implementation->options.quota;
+    constexpr size_t kNumber = 20; // digits of each of the two numbers
+    const std::string counted = textOfServersFile(stateDirectory() + "/lists/" + user + ".used", 2 * kNumber + 2);
+    if (counted.size() == 2 * kNumber + 2) room.used = std::strtoull(counted.c_str() + kNumber, nullptr, 10);
+    return room;
+}
+
 std::string PrivateStore::baseURL() const {
-    const int port = _implementation->savedPort();
-    if (port == 0)
-        fail("The store in " + stateDirectory() + " has never been started. Start it with: rolvane store start");
-    return (_implementation->options.tls ? "https" : "http") + std::string("://localhost:") + std::to_string(port) +
-           "/dav";
+    const std::string& name = _implementation->options.name;
+    return _implementation->urlBy(name.empty() ? "localhost" : name);
+}
+
+std::string PrivateStore::localURL() const {
+    return _implementation->urlBy("localhost");
+}
+
+std::string PrivateStore::certificateFile() const {
+    return _implementation->shownCertificate();
+}
+
+std::string PrivateStore::authorityFingerprint() const {
+    const auto& options = _implementation->options;
+    const std::string file = certificateFile();
+    if (file.empty())
+        fail("The store has no certificate yet: " + options.acmeDirectory +
+             " has not given one. The store's log says how far that is: " + errorLog());
+    if (!options.certificate.empty() || !options.acmeDirectory.empty())
+        return isKnownToTheSystem(file) ? "" : fingerprintOfAuthority(file);
+    const std::string own = fingerprintOfCertificate(caFile());
+    if (own.empty())
+        fail("The authority's file " + caFile() +
+             " holds no certificate. `rolvane store stop && rolvane store start` makes another one.");
+    return own;
 }
 
 std::string PrivateStore::endpointTemplate() const {

@@ -26,6 +26,16 @@ struct PrivateStoreOptions {
     bool accessLists = true; // owners say who may read and write their trees; needs authentication
     std::vector<std::string> hosts = {"localhost", "127.0.0.1", "::1"}; // names and addresses in the certificate
 
+    // A store for other machines has a name of its own and listens on all addresses, not on the loopback ones alone.
+    std::string name; // "" for a store of this machine
+    // TLS: the store's own authority, unless there are files of an administrator's, or a directory of ACME (RFC 8555),
+    // where httpd's mod_md fetches a certificate for the name and renews it.
+    std::string certificate, certificateKey; // PEM files: the whole chain, and its key
+    std::string acmeDirectory, acmeContact;  // a URL, and an address for letters; "" for none
+    std::string acmeAuthority;               // PEM: who signed the certificate of that directory; "": the system knows
+    std::string quota;                       // that each user's tree may take, such as "2G" or "none"; "": none is kept
+    bool slowsGuesses = false;               // pauses after wrong passwords, for each address and user
+
     int processes = 1; // at start; grows up to maximumProcesses
     int maximumProcesses = 4;
     // httpd closes every kept connection of a process whose threads are all at work, and their clients come back with a
@@ -44,6 +54,7 @@ struct PrivateStoreOptions {
     std::string httpdProgram = "/usr/sbin/apache2";
     std::string httpdModules = "/usr/lib/apache2/modules";
     std::string configurationTemplate; // a file; "" = the one that was built or installed with the program
+    std::string program;               // rolvane, for what httpd has it do; "" = the program that starts the store
     std::string accessModule;          // a file, mod_davacl; "" likewise, else the one among httpdModules
 
     bool keepsAccessLists() const { return accessLists && authentication != StoreAuthentication::none; }
@@ -81,6 +92,11 @@ public:
     // another program holds is an error, not a reason to move, as clients know the store by it.
     void start();
 
+    // Writes the configuration anew, and has a running httpd take it in, open its logs again and use a renewed
+    // certificate, while requests go on. Where httpd would not start with it, the former one stays. False when the
+    // store does not run.
+    bool reload();
+
     using Stop = HttpdLauncher::Stop;
     // Returns when the process is gone; requests under way are finished first if asked. Nothing when not running.
     void stop(Stop how = Stop::atOnce);
@@ -95,12 +111,27 @@ public:
     bool removeUser(const std::string& user);
     std::vector<std::string> users() const; // ascending
 
+    // The user's own quota ("5G", "none"), or "" for that of everybody; a running store takes it in at once.
+    void setQuota(const std::string& user, const std::string& quota);
+    struct Room {
+        std::optional<uint64_t> used; // bytes, as they were counted last; nothing before the first change
+        std::string quota;            // as it was set; "" where none is kept
+        bool isOwn = false;           // the user's, not everybody's
+    };
+    Room roomOf(const std::string& user) const;
+
     std::string stateDirectory() const;
     std::string documentRoot() const;
     std::string userDirectory(const std::string& user) const; // where the files of /dav/<user> are
     std::string caFile() const;                               // PEM, what a client has to trust; made by start()
     std::string errorLog() const;
-    std::string baseURL() const;          // "https://localhost:PORT/dav"; throws before the first start
+    std::string baseURL() const;  // "https://localhost:PORT/dav"; throws before the first start
+    std::string localURL() const; // the same, by this machine's own name
+    // What the store shows to clients: the certificate's PEM file. "" while ACME has not given one yet.
+    std::string certificateFile() const;
+    // What a client has to trust, as SHA-256 of a certificate that the store shows; "" when the system's authorities
+    // have signed for it. CXException while there is no certificate.
+    std::string authorityFingerprint() const;
     std::string endpointTemplate() const; // baseURL() + "/{user}/Contacts"
 
 private:

@@ -137,6 +137,36 @@ int numberOfNames(X509* certificate) {
     return all ? sk_GENERAL_NAME_num(all.get()) : 0;
 }
 
+std::vector<Certificate> readCertificates(const std::string& path) {
+    std::vector<Certificate> all;
+    const Memory file(BIO_new_file(path.c_str(), "r"));
+    while (file) {
+        Certificate next(PEM_read_bio_X509(file.get(), nullptr, nullptr, nullptr));
+        if (!next) break;
+        all.push_back(std::move(next));
+    }
+    ERR_clear_error();
+    return all;
+}
+
+std::string fingerprintOf(X509* certificate) {
+    unsigned char digest[EVP_MAX_MD_SIZE];
+    unsigned int size = 0;
+    if (X509_digest(certificate, EVP_sha256(), digest, &size) != 1) return {};
+    std::string text;
+    for (unsigned int i = 0; i < size; ++i) {
+        if (i > 0) text += ':';
+        text += "0123456789ABCDEF"[digest[i] >> 4];
+        text += "0123456789ABCDEF"[digest[i] & 15];
+    }
+    return text;
+}
+
+// The certificates in it are somebody else's.
+void freeStack(STACK_OF(X509) * stack) {
+    sk_X509_free(stack);
+}
+
 } // namespace
 
 bool StoreCertificates::ensure(const std::vector<std::string>& hosts, std::chrono::seconds lifetime) {
@@ -163,16 +193,25 @@ std::string certificateProblem(const std::string& certificate, const std::string
 
 std::string fingerprintOfCertificate(const std::string& file) {
     const Certificate certificate = readCertificate(file);
-    unsigned char digest[EVP_MAX_MD_SIZE];
-    unsigned int size = 0;
-    if (!certificate || X509_digest(certificate.get(), EVP_sha256(), digest, &size) != 1) return {};
-    std::string text;
-    for (unsigned int i = 0; i < size; ++i) {
-        if (i > 0) text += ':';
-        text += "0123456789ABCDEF"[digest[i] >> 4];
-        text += "0123456789ABCDEF"[digest[i] & 15];
-    }
-    return text;
+    return certificate ? fingerprintOf(certificate.get()) : "";
+}
+
+bool isKnownToTheSystem(const std::string& file) {
+    const std::vector<Certificate> all = readCertificates(file);
+    const std::unique_ptr<X509_STORE, Release<X509_STORE_free>> known(X509_STORE_new());
+    const std::unique_ptr<X509_STORE_CTX, Release<X509_STORE_CTX_free>> check(X509_STORE_CTX_new());
+    const std::unique_ptr<STACK_OF(X509), Release<freeStack>> between(sk_X509_new_null());
+    bool good = !all.empty() && known && check && between && X509_STORE_set_default_paths(known.get()) == 1;
+    for (const Certificate& each : all) good = good && sk_X509_push(between.get(), each.get()) > 0;
+    good = good && X509_STORE_CTX_init(check.get(), known.get(), all.front().get(), between.get()) == 1 &&
+           X509_verify_cert(check.get()) == 1;
+    ERR_clear_error();
+    return good;
+}
+
+std::string fingerprintOfAuthority(const std::string& file) {
+    const std::vector<Certificate> all = readCertificates(file);
+    return all.empty() ? "" : fingerprintOf(all.back().get());
 }
 
 bool StoreCertificates::areGoodFor(const std::vector<std::string>& hosts, std::chrono::seconds lifetime) const {

@@ -40,6 +40,11 @@ private:
 // SHA-256 of the first certificate in a PEM file, "AB:CD:..."; "" when there is none.
 std::string fingerprintOfCertificate(const std::string& file);
 
+// Whether the first certificate of a PEM file leads to an authority of the system, with the others in between.
+bool isKnownToTheSystem(const std::string& file);
+// SHA-256 of the last certificate in a PEM file, "AB:CD:..."; "" when there is none.
+std::string fingerprintOfAuthority(const std::string& file);
+
 // Why a server cannot use these two PEM files, as a sentence; "" when it can.
 std::string certificateProblem(const std::string& certificate, const std::string& key);
 

@@ -5,6 +5,7 @@
 #include "server/HttpdTemplate.h"
 
 #include <algorithm>
+#include <filesystem>
 
 namespace rolvane {
 
@@ -19,6 +20,9 @@ std::string switches(const PrivateStoreOptions& options) {
     if (options.authentication == StoreAuthentication::digest) text += "Define DIGEST\n";
     if (options.needsModule()) text += "Define DAVACL\n";
     if (options.keepsAccessLists()) text += "Define ACCESSLISTS\n";
+    if (!options.acmeDirectory.empty()) text += "Define ACME\n";
+    if (!options.quota.empty()) text += "Define QUOTA\n";
+    if (options.slowsGuesses) text += "Define SLOWGUESSES\n";
     return text;
 }
 
@@ -31,6 +35,34 @@ Array toArray(const std::vector<std::string>& texts) {
     Array array;
     for (const auto& text : texts) array.append(text);
     return array;
+}
+
+std::string quoted(const std::string& text) {
+    refuseUnsafePath("The store", "/" + text); // as an argument it may begin with anything
+    return "\"" + text + "\"";
+}
+
+// A name of its own is known from everywhere, so httpd listens on all addresses of the machine, whatever their kind.
+std::string listenLines(const PrivateStoreOptions& options, const std::string& port, bool withIPv6) {
+    if (!options.name.empty()) return "Listen " + port;
+    return "Listen 127.0.0.1:" + port + (withIPv6 ? "\nListen [::1]:" + port : "");
+}
+
+std::string acmeLines(const PrivateStoreOptions& options) {
+    std::string lines;
+    if (!options.acmeContact.empty()) lines += "  MDContactEmail " + quoted(options.acmeContact) + "\n";
+    if (!options.acmeAuthority.empty()) lines += "  MDCACertificateFile " + quoted(options.acmeAuthority) + "\n";
+    return lines;
+}
+
+// The program's path is the one that it runs from now.
+std::string reloadCommand(const PrivateStoreOptions& options) {
+    std::error_code error;
+    const std::string program =
+        options.program.empty() ? std::filesystem::read_symlink("/proc/self/exe", error).string() : options.program;
+    // httpd hands its environment on, which has no home in it.
+    return "/usr/bin/env " + quoted("HOME=" + options.stateDirectory) + " " + quoted(program) +
+           " store reload --quiet --directory " + quoted(options.stateDirectory) + " --event";
 }
 
 std::vector<std::string> toStrings(const Array& array) {
@@ -62,6 +94,10 @@ std::string renderStoreConfiguration(const std::string& templateText, const Priv
                           "The store's access lists and passwords need mod_davacl.so, which is missing from " +
                               std::string(ROLVANE_INSTALLED_MODULES) + ". Install rolvane again.");
     refuseUnsafePath("The store", module);
+    const std::string tls = options.stateDirectory + "/tls/server";
+    const bool isGiven = !options.certificate.empty();
+    const std::string certificate = isGiven ? options.certificate : tls + ".pem";
+    for (const auto& path : {certificate, isGiven ? options.certificateKey : tls}) refuseUnsafePath("The store", path);
     const std::string number = std::to_string(port);
     const int threads = std::clamp(options.threadsPerProcess, 1, 1000);
     const int processes = std::clamp(options.processes, 1, 100);
@@ -73,7 +109,16 @@ std::string renderStoreConfiguration(const std::string& templateText, const Priv
                      {"MODULES", options.httpdModules},
                      {"DAVACL", module},
                      {"REALM", kStoreRealm},
-                     {"LISTEN", "Listen 127.0.0.1:" + number + (withIPv6 ? "\nListen [::1]:" + number : "")},
+                     {"NAME", options.name.empty() ? "localhost" : options.name},
+                     {"LISTEN", listenLines(options, number, withIPv6)},
+                     {"PORT", number},
+                     {"CERTIFICATE", certificate},
+                     {"KEY", isGiven ? options.certificateKey : tls + ".key"},
+                     {"ACME_DIRECTORY", quoted(options.acmeDirectory)},
+                     {"ACME_MORE", acmeLines(options)},
+                     {"ACME_PROTOCOL", options.acmeDirectory.empty() ? "" : "acme-tls/1"},
+                     {"RELOAD", reloadCommand(options)},
+                     {"QUOTA", options.quota},
                      {"PROCESSES", std::to_string(processes)},
                      {"SERVER_LIMIT", std::to_string(2 * limit)},
                      {"THREADS", std::to_string(threads)},
@@ -118,6 +163,14 @@ Dictionary storeOptionsToDictionary(const PrivateStoreOptions& options, int port
     d.set("http2", options.http2);
     d.set("accessLists", options.accessLists);
     d.set("hosts", toArray(options.hosts));
+    d.set("name", options.name);
+    d.set("certificate", options.certificate);
+    d.set("certificateKey", options.certificateKey);
+    d.set("acmeDirectory", options.acmeDirectory);
+    d.set("acmeContact", options.acmeContact);
+    d.set("acmeAuthority", options.acmeAuthority);
+    d.set("quota", options.quota);
+    d.set("slowsGuesses", options.slowsGuesses);
     d.set("processes", options.processes);
     d.set("maximumProcesses", options.maximumProcesses);
     d.set("threadsPerProcess", options.threadsPerProcess);
@@ -139,6 +192,14 @@ PrivateStoreOptions storeOptionsFromDictionary(const Dictionary& d) {
     options.http2 = d["http2"].boolean(options.http2);
     options.accessLists = d["accessLists"].boolean(options.accessLists);
     if (d.contains("hosts")) options.hosts = toStrings(d["hosts"].array());
+    options.name = d["name"].string();
+    options.certificate = d["certificate"].string();
+    options.certificateKey = d["certificateKey"].string();
+    options.acmeDirectory = d["acmeDirectory"].string();
+    options.acmeContact = d["acmeContact"].string();
+    options.acmeAuthority = d["acmeAuthority"].string();
+    options.quota = d["quota"].string();
+    options.slowsGuesses = d["slowsGuesses"].boolean(options.slowsGuesses);
     readInteger("port", options.port);
     readInteger("processes", options.processes);
     readInteger("maximumProcesses", options.maximumProcesses);

@@ -144,6 +144,32 @@ StoreIdentity StoreIdentity::choose() {
         "of them, or start the store as an ordinary user.");
 }
 
+StoreIdentity StoreIdentity::named(const std::string& user) {
+    passwd entry{};
+    passwd* found = nullptr;
+    std::array<char, 16384> texts{};
+    if (getpwnam_r(user.c_str(), &entry, texts.data(), texts.size(), &found) != 0 || !found)
+        fail("This machine has no user " + user + ". The package rolvane-store makes it.");
+    StoreIdentity identity;
+    identity.change = true;
+    identity.uid = found->pw_uid;
+    identity.gid = found->pw_gid;
+    identity.name = user;
+    return identity;
+}
+
+void StoreIdentity::takeOn(bool ports) const {
+    prctl(PR_SET_KEEPCAPS, 1, 0, 0, 0);
+    if (initgroups(name.c_str(), gid) != 0 || setresgid(gid, gid, gid) != 0 || setresuid(uid, uid, uid) != 0)
+        fail("The user " + name + " cannot be taken on: " + std::strerror(errno) + ".");
+    // Where a container withholds it, httpd says that it may not listen there.
+    if (!ports || !inBoundingSet(CAP_NET_BIND_SERVICE) || !keepCapability(CAP_NET_BIND_SERVICE)) {
+        __user_cap_header_struct header{_LINUX_CAPABILITY_VERSION_3, 0};
+        __user_cap_data_struct none[2] = {};
+        if (syscall(SYS_capset, &header, none) != 0) fail("The rights of root cannot be given up.");
+    }
+}
+
 bool StoreIdentity::reaches(const std::string& path) const {
     if (!change) return true;
     const auto searchable = [&](const std::filesystem::path& directory) {

@@ -40,6 +40,11 @@ struct StoreIdentity {
 
     // www-data, else nobody, for root; the process's own user for anybody else. CXException when root has neither.
     static StoreIdentity choose();
+    // The user with that name. CXException when there is none.
+    static StoreIdentity named(const std::string& user);
+    // Makes this process, which root has started, one of that user's, for good. With `ports` it may go on to listen on
+    // ports below 1024, as far as the machine lets it. CXException when it cannot.
+    void takeOn(bool ports) const;
     // Whether that user may search every directory on the way to the path, the path itself included.
     bool reaches(const std::string& path) const;
     // Carries the action out as that user, in a process of its own, and returns what the action returned (0 to 255).

@@ -105,6 +105,12 @@ const std::map<std::string, const char*>& examples() {
         {"defaults write", "  rolvane defaults write CXDDebugLevel 1 --type int"},
         {"store start", "  rolvane store start\n"
                         "  rolvane store start --directory ~/stores/work --port 8443"},
+        {"store reload", "  rolvane store reload --system"},
+        {"store backup", "  rolvane store backup store.tar.gz\n"
+                         "  rolvane store backup --system --keep 14 /var/backups/rolvane-store"},
+        {"store restore", "  rolvane store restore store.tar.gz"},
+        {"store user quota", "  rolvane store user quota\n"
+                             "  rolvane store user quota bob 2G --system"},
         {"books on", "  rolvane books on && rolvane books device add laptop\n"
                      "  rolvane books on --listen 192.168.1.20"},
         {"books device add", "  rolvane books device add laptop\n"
