@@ -6,10 +6,10 @@
 namespace rolvane::test {
 namespace {
 
-const std::vector<std::string> kPages{
-    "rolvane.1",           "RolvaneManager.8", "rolvane-formats.5",    "mod_davacl.5",        "rolvane-books.7",
-    "rolvane-computers.7", "rolvane-moving.7", "rolvane-backing-up.7", "rolvane-upgrading.7", "rolvane-removing.7",
-    "rolvane-store.7"};
+const std::vector<std::string> kPages{"rolvane.1",          "RolvaneManager.8",     "rolvane-formats.5",
+                                      "mod_davacl.5",       "rolvane-books.7",      "rolvane-computers.7",
+                                      "rolvane-moving.7",   "rolvane-backing-up.7", "rolvane-upgrading.7",
+                                      "rolvane-removing.7", "rolvane-store.7"};
 
 std::string pagePath(const std::string& page) {
     return ROLVANE_BINARY_DIR "/packaging/man/" + page;
