@@ -131,6 +131,10 @@ PrivateStoreOptions withStoreSettings(PrivateStoreOptions options, const std::st
              "dav.example.org");
     if (options.certificate.empty() == given.contains("key"))
         fail("The store's settings need both or neither: the file of a certificate, and the file of its key.");
+    // httpd's module makes no account with the authority without one.
+    if (wantsAcme && options.acmeContact.empty())
+        fail("The store's settings do not say to whom the certificate's authority may write. Add a line such as: "
+             "acme-contact = you@example.org");
     options.hosts = {options.name, "localhost", "127.0.0.1", "::1"};
     options.tls = true;
     options.authentication = StoreAuthentication::basic;

@@ -22,8 +22,8 @@ std::string complaintAbout(const std::string& text) {
     return {};
 }
 
-TEST(StoreSettings, NeedANameAndNothingElse) {
-    const auto o = withStoreSettings({}, "# comment\n\n  name =  dav.example.org \n");
+TEST(StoreSettings, NeedANameAndWhomTheAuthorityMayWriteTo) {
+    const auto o = withStoreSettings({}, "# comment\n\n  name =  dav.example.org \nacme-contact = x@y\n");
     EXPECT_EQ(o.name, "dav.example.org");
     EXPECT_EQ(o.port, 443);
     EXPECT_EQ(o.acmeDirectory, "https://acme-v02.api.letsencrypt.org/directory");
@@ -31,6 +31,8 @@ TEST(StoreSettings, NeedANameAndNothingElse) {
     EXPECT_TRUE(o.slowsGuesses);
     EXPECT_EQ(o.hosts, (std::vector<std::string>{"dav.example.org", "localhost", "127.0.0.1", "::1"}));
     EXPECT_THAT(complaintAbout("port = 443\n"), HasSubstr("name = dav.example.org"));
+    EXPECT_THAT(complaintAbout("name = dav.example.org\n"), HasSubstr("acme-contact"));
+    EXPECT_EQ(complaintAbout("name = dav.example.org\ncertificate = own\n"), "");
 }
 
 TEST(StoreSettings, TakeWhatIsWrittenAndForgetWhatIsNot) {
@@ -73,7 +75,7 @@ TEST(StoreSettings, NameTheLineThatCannotBeUsed) {
 }
 
 TEST(StoreSettings, MakeAConfigurationThatListensEverywhereAndSlowsGuesses) {
-    auto o = withStoreSettings({}, "name = dav.example.org\nquota = 1G\n");
+    auto o = withStoreSettings({}, "name = dav.example.org\nacme-contact = x@y\nquota = 1G\n");
     o.stateDirectory = "/state";
     o.documentRoot = "/root";
     const std::string text = renderStoreConfiguration(readFile(storeTemplatePath()), o, 443, true);
