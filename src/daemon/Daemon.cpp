@@ -53,21 +53,6 @@ namespace rolvane {
 
 namespace {
 
-// Everything that counts is durable at any moment, so the process ends at once, whatever its other threads do.
-class UnixProcessEnd : public ProcessEnd {
-public:
-    explicit UnixProcessEnd(const DaemonChannel& channel) : _channel(channel) {}
-    [[noreturn]] void end(int status) override {
-        _channel.removeFile();
-        sd_notify(0, "STOPPING=1");
-        std::fflush(nullptr);
-        ::_exit(status);
-    }
-
-private:
-    const DaemonChannel& _channel;
-};
-
 // What the watch's thread may touch while the main thread is at work.
 struct Termination {
     int event = ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK); // readable: the loop is to end the process
@@ -88,6 +73,22 @@ Termination& termination() {
     static Termination state;
     return state;
 }
+
+// Everything that counts is durable at any moment, so the process ends at once, whatever its other threads do.
+class UnixProcessEnd : public ProcessEnd {
+public:
+    explicit UnixProcessEnd(const DaemonChannel& channel) : _channel(channel) {}
+    [[noreturn]] void end(int status) override {
+        _channel.removeFile();
+        sd_notify(0, "STOPPING=1");
+        if (const CXDAVManager* client = termination().store) client->processEnds();
+        std::fflush(nullptr);
+        ::_exit(status);
+    }
+
+private:
+    const DaemonChannel& _channel;
+};
 
 // The process's collaborators, made in the order in which they need each other; they live until the process ends.
 class Daemon {

@@ -105,6 +105,8 @@ constexpr Line kLines[] = {
     {"The group has been deleted by somebody else, and is not changed any more: %@", &kGoneElsewhere, "n"},
     {"The lock on %s is left to expire: %@", &kLock, "tt"},
     {"The memory of versions could not be saved: %@", &kMemoryNotKept, "t"},
+    {"What is remembered of the store could not be saved: %@", &kMemoryNotKept, "t"},
+    {"What is remembered of the store could not be kept: %@", &kMemoryNotKept, "t"},
     {"The outcome of the pass could not be stored: %@", &kPassFailed, "t"},
     {"The publication has ended: %@.", &kSharingEnded, "-"},
     {"The published tree could not be looked after: %@", &kTreeDamaged, "t"},

@@ -125,7 +125,8 @@ private:
 };
 
 struct Client {
-    Client(DiskStore& store, bool synchronizes) : manager(account(), store.wire(synchronizes)) {
+    Client(DiskStore& store, bool synchronizes, const std::string& memory = {})
+        : manager(account(), store.wire(synchronizes), CXDAVManager::VersionsFile{memory}) {
         CXDAVError error;
         EXPECT_TRUE(manager.canReach(error)) << error.reason;
     }
@@ -146,6 +147,8 @@ struct Client {
                    (info.seen ? " seen\n" : "\n");
         return out;
     }
+    // As at the end of a pass.
+    void save() { manager.saveVersionMemory("database", 1); }
     CXDAVManager manager;
 };
 
@@ -172,12 +175,43 @@ TEST(SyncedListing, CostsOneRequestHoweverLargeTheTreeIs) {
     EXPECT_EQ(store.asked["PROPFIND"], before) << "nothing is listed";
 }
 
+TEST(SyncedListing, OfAProcessThatStartsAsksForWhatHasChangedSinceTheLastOne) {
+    DiskStore store;
+    for (int i = 0; i < 20; ++i) {
+        const std::string bucket = "People/" + std::to_string(i);
+        fs::create_directory(store.tree / bucket);
+        store.put(bucket + "/a:CXPerson", "one");
+    }
+    const std::string memory = store.home.path("memory") + "/versions";
+    fs::create_directory(store.home.path("memory"));
+    {
+        Client former(store, true, memory);
+        former.shown();
+        former.save();
+    }
+    store.put("People/7/b:CXPerson", "two");
+    Client client(store, true, memory);
+    store.asked.clear();
+    const std::string shown = client.shown();
+    EXPECT_NE(shown.find("/alice/Contacts/People/7/b:CXPerson b:CXPerson \"two\" 3"), std::string::npos) << shown;
+    EXPECT_NE(shown.find("/alice/Contacts/People/8/a:CXPerson a:CXPerson \"one\" 3"), std::string::npos) << shown;
+    EXPECT_EQ(store.asked["REPORT"], 1);
+    EXPECT_EQ(store.asked["PROPFIND"], 0) << "nothing is listed";
+    store.asked.clear();
+    Client withoutMemory(store, true);
+    EXPECT_EQ(withoutMemory.shown(), shown);
+    EXPECT_GT(store.asked["PROPFIND"], 20);
+}
+
 // What is listed by changes is what the literal listing gives, whatever has happened to the tree or to the answers.
 class SyncedListings : public testing::TestWithParam<unsigned> {};
 
 TEST_P(SyncedListings, AreTheLiteralListingsAfterRandomHistories) {
     DiskStore store;
-    Client literal(store, false), synced(store, true);
+    const std::string memory = store.home.path("memory") + "/versions";
+    fs::create_directory(store.home.path("memory"));
+    Client literal(store, false);
+    std::optional<Client> synced(std::in_place, store, true, memory);
     std::mt19937 random(GetParam());
     const auto upTo = [&](size_t n) { return std::uniform_int_distribution<size_t>(0, n - 1)(random); };
     const auto letter = [&] { return std::string(1, static_cast<char>('a' + upTo(3))); };
@@ -194,8 +228,13 @@ TEST_P(SyncedListings, AreTheLiteralListingsAfterRandomHistories) {
         return all[upTo(std::size(all))]();
     };
     std::error_code ignored;
-    size_t reports = 0, refreshed = 0;
+    size_t reports = 0, refreshed = 0, starts = 0;
     for (int history = 0; history < 2500; ++history) {
+        if (!upTo(3)) synced->save();
+        if (!upTo(20)) { // with what was saved last, which may be long ago
+            synced.emplace(store, true, memory);
+            ++starts;
+        }
         for (size_t changes = upTo(4); changes; --changes) switch (upTo(12)) {
             case 0:
             case 1:
@@ -218,7 +257,7 @@ TEST_P(SyncedListings, AreTheLiteralListingsAfterRandomHistories) {
                 store.limit = upTo(2) ? 5000 : 1 + upTo(3);
             }
         const int before = store.asked["REPORT"], listed = store.asked["PROPFIND"];
-        const std::string found = synced.shown();
+        const std::string found = synced->shown();
         refreshed += store.asked["PROPFIND"] > listed;
         reports += store.asked["REPORT"] > before;
         ASSERT_EQ(found, literal.shown()) << "history " << history;
@@ -226,6 +265,7 @@ TEST_P(SyncedListings, AreTheLiteralListingsAfterRandomHistories) {
     }
     EXPECT_GT(reports, 2250u);
     EXPECT_LT(refreshed, 500u) << "most histories need no listing";
+    EXPECT_GT(starts, 50u);
 }
 
 INSTANTIATE_TEST_SUITE_P(Seeds, SyncedListings, testing::Values(17u, 18u, 19u, 20u));

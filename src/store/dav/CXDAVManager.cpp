@@ -47,6 +47,15 @@ std::string treeOf(const CXDAVAccount& account) {
     return account.user.empty() ? "\n" : account.baseLocationFor(account.user).absoluteString() + "/";
 }
 
+std::string beside(const std::string& versions, const char* name) {
+    return versions.empty() ? std::string() : versions.substr(0, versions.rfind('/') + 1) + name;
+}
+
+// Who asks whom, and for what: anybody else is shown something else.
+std::string ownerOf(const CXDAVAccount& account, const char* what) {
+    return std::string(what) + "\n" + account.user.str() + "\n" + account.endpoint + "\n" + account.nameHost;
+}
+
 bool isSecure(const Url& url) {
     return strcasecmp(url.scheme().c_str(), "https") == 0;
 }
@@ -59,9 +68,29 @@ void setCode(int* code, int value) {
 
 CXDAVManager::Impl::Impl(CXDAVAccount account, std::shared_ptr<HttpTransport> transport, CurlTransport* signsIn,
                          std::string versionsPath)
-    : versions(std::move(versionsPath)), session(std::move(account), std::move(transport), signsIn),
+    : versions(versionsPath), session(std::move(account), std::move(transport), signsIn),
       files(session, tokens, versions), structure(session, files), accessLists(session),
-      ownTree(treeOf(session.account())) {}
+      ownTree(treeOf(session.account())),
+      groupFile(beside(versionsPath, "groups"), ownerOf(session.account(), "groups 1")),
+      _listingFile(beside(versionsPath, "listings"), ownerOf(session.account(), "listings 1")) {}
+
+ListingMemory& CXDAVManager::Impl::listings() {
+    std::call_once(_listingsRead, [this] {
+        if (!_listings.restore(_listingFile.read())) CXDLog("The memory of listings is not whole.");
+    });
+    return _listings;
+}
+
+GroupCopies& CXDAVManager::Impl::copies() {
+    std::call_once(_copiesRead, [this] { files.copies().restore(groupFile.read()); });
+    return files.copies();
+}
+
+void CXDAVManager::Impl::saveListings(bool atEnd) {
+    if (!listings().isWorthSaving(atEnd)) return;
+    _listingFile.write(listings().saved());
+    listings().wasSaved();
+}
 
 StoreFiles::Reading CXDAVManager::Impl::read(const Url& name, bool securely) {
     const auto endsATree = [](int code) { return code == 403 || code == 404; };
@@ -233,13 +262,14 @@ std::optional<FileListing> CXDAVManager::infoForFilesInContainer(const Url& url)
 }
 
 std::optional<FileListing> CXDAVManager::infoForFilesInContainerByParts(const Url& url, const ListingPart& part) {
-    auto listing = StoreListing(_impl->session, _impl->versions, _impl->listings).list(url, _impl->begun(url), part);
+    auto listing = StoreListing(_impl->session, _impl->versions, _impl->listings()).list(url, _impl->begun(url), part);
     if (!listing) return listing;
     for (const auto& [path, file] : *listing) {
         if (!file.displayName.ends_with("CXGroup")) continue;
         const Url group = url.cxURLByAppendingComponent(file.displayName);
         if (file.isCollection) _impl->files.foundCollection(group);
-        if (file.seen) _impl->files.copies().foundUnchanged(group.absoluteString());
+        if (file.seen)
+            _impl->copies().foundUnchanged(group.absoluteString(), _impl->versions.markOf(group.absoluteString()));
     }
     return listing;
 }
@@ -253,13 +283,13 @@ void CXDAVManager::expectSomeReads(const std::vector<Url>& urls, bool securely) 
 }
 
 void CXDAVManager::expectListing(const Url& url) {
-    auto begun = StoreListing(_impl->session, _impl->versions, _impl->listings).begin(url);
+    auto begun = StoreListing(_impl->session, _impl->versions, _impl->listings()).begin(url);
     const std::lock_guard guard(_impl->begunLock);
     _impl->begunListings.insert_or_assign(url.absoluteString(), std::move(begun));
 }
 
 bool CXDAVManager::isToBeListed(const Url& tree) const {
-    return _impl->session.maySynchronize() && _impl->listings.token(tree).empty();
+    return _impl->session.maySynchronize() && _impl->listings().token(tree).empty();
 }
 
 // Nothing of it counts for the versions that are known: what a pass finds out of them is stored with the pass.
@@ -270,8 +300,8 @@ std::unique_ptr<ListingMemory> CXDAVManager::listAhead(const Url& tree) {
 }
 
 bool CXDAVManager::keepListing(const Url& tree, std::unique_ptr<ListingMemory> listed) {
-    if (listed) _impl->listings.takeOver(tree, std::move(*listed));
-    return !_impl->listings.token(tree).empty();
+    if (listed) _impl->listings().takeOver(tree, std::move(*listed));
+    return !_impl->listings().token(tree).empty();
 }
 
 void CXDAVManager::expectNothing() {
@@ -281,10 +311,10 @@ void CXDAVManager::expectNothing() {
 }
 
 CXDAVManager::Snapshot::Snapshot(CXDAVManager& manager) : _impl(manager._impl) {
-    _impl->files.copies().beginSnapshot();
+    _impl->copies().beginSnapshot();
 }
 CXDAVManager::Snapshot::~Snapshot() {
-    _impl->files.copies().endSnapshot();
+    _impl->copies().endSnapshot();
 }
 
 void CXDAVManager::keepSerialNumber(const std::string& serial) {
@@ -299,18 +329,18 @@ bool CXDAVManager::sanityCheckPublishStructureCreate(bool create) {
 std::optional<CXDAVManager::TreeMark> CXDAVManager::markOfTree(const Url& tree, bool ask) {
     if (ask) {
         StoreListing::AskedRef begun = _impl->begun(tree);
-        if (!StoreListing(_impl->session, _impl->versions, _impl->listings).bringUpToDate(tree, begun))
+        if (!StoreListing(_impl->session, _impl->versions, _impl->listings()).bringUpToDate(tree, begun))
             return std::nullopt;
         const std::lock_guard guard(_impl->begunLock);
         _impl->begunListings.insert_or_assign(tree.absoluteString(), std::move(begun));
     }
-    const uint64_t listing = _impl->listings.stateOf(tree);
+    const uint64_t listing = _impl->listings().stateOf(tree);
     return listing == 0 ? std::nullopt : std::optional(TreeMark{listing, _impl->versions.changes()});
 }
 
 std::map<std::string, Date> CXDAVManager::datesOfTree(const Url& tree) {
     std::map<std::string, Date> dates;
-    _impl->listings.forEach(tree, ListingMemory::kSynced, [&](const ListingMemory::Member& member) {
+    _impl->listings().forEach(tree, ListingMemory::kSynced, [&](const ListingMemory::Member& member) {
         if ((member.encodedName == "info" || member.encodedName == "dateFile") && member.entry.lastModified)
             dates.emplace(member.encodedName, *member.entry.lastModified);
     });
@@ -340,14 +370,28 @@ bool CXDAVManager::setACLsWithReadPrincipals(const std::vector<std::string>& rea
 
 void CXDAVManager::useVersionMemoryOf(const std::string& database, int64_t passes) {
     _impl->versions.belongTo(ownerOf(database, passes));
+    _impl->isOfDaemon = true;
 }
 void CXDAVManager::saveVersionMemory(const std::string& database, int64_t passes) {
     _impl->versions.save(ownerOf(database, passes));
+    _impl->saveListings(false);
 }
 void CXDAVManager::revertVersionMemory() {
     _impl->versions.revert();
-    _impl->listings.forgetAll();
+    _impl->listings().forgetAll();
+    _impl->copies().forgetAll(); // of versions that count as not seen
 }
+// The marks of versions stand in the file of versions. So a copy that is newer than that file counts for nothing.
+void CXDAVManager::processEnds() const noexcept try {
+    if (!_impl->isOfDaemon) return;
+    _impl->saveListings(true);
+    if (!_impl->copies().hasChanged()) return;
+    _impl->groupFile.write(
+        _impl->copies().saved([this](const std::string& name) { return _impl->versions.markOf(name); }));
+} catch (const std::exception& e) {
+    CXLog("What is remembered of the store could not be kept: %@", e.what());
+}
+
 void CXDAVManager::forgetVersion(const Url& url) {
     _impl->versions.forget(url.absoluteString());
 }

@@ -185,6 +185,9 @@ public:
     void saveVersionMemory(const std::string& database, int64_t passes);
     // The database could not keep what was read since.
     void revertVersionMemory();
+    // Keeps what saves the next process requests; of a client that was told of a database. To be called once, when
+    // nothing is under way that anybody waits for.
+    void processEnds() const noexcept;
     // The next listing gives the file as one that was not seen yet, so that it is read once more.
     void forgetVersion(const Url& url);
 

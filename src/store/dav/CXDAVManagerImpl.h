@@ -7,8 +7,10 @@
 #include "store/files/StoreListing.h"
 #include "store/http/StoreSession.h"
 #include "store/locks/LockTokens.h"
+#include "store/reads/CacheFile.h"
 #include "store/reads/VersionMemory.h"
 
+#include <atomic>
 #include <map>
 #include <mutex>
 
@@ -21,12 +23,18 @@ struct CXDAVManager::Impl {
 
     LockTokens tokens;
     VersionMemory versions;
-    ListingMemory listings;
     StoreSession session;
     StoreFiles files;
     PublishStructure structure;
     StoreAccessLists accessLists;
     const std::string ownTree; // what every name below the account's own tree begins with
+
+    // The listings and the copies of groups, of former processes too. Any thread.
+    ListingMemory& listings();
+    GroupCopies& copies();
+    void saveListings(bool atEnd);
+    std::atomic<bool> isOfDaemon = false; // what it remembers of the store is worth keeping
+    const CacheFile groupFile;
 
     // Reads a dictionary. That a tree's "info" is forbidden or absent, which ends a publication or a subscription, is
     // told only when the store says it twice; in between it shows that it is a WebDAV server, and its owner's client
@@ -36,6 +44,11 @@ struct CXDAVManager::Impl {
     std::mutex begunLock;
     std::map<std::string, StoreListing::AskedRef> begunListings; // by container; guarded by begunLock
     StoreListing::AskedRef begun(const Url& container);          // hands it out; null when there is none
+
+private:
+    ListingMemory _listings;
+    const CacheFile _listingFile;
+    std::once_flag _listingsRead, _copiesRead;
 };
 
 } // namespace rolvane

@@ -120,6 +120,7 @@ bool SyncedListing::take(const Url& tree, const HttpResponse& answer, bool& isCu
     isCut = applied->isCut;
     if (isCut && reader.syncToken() == _memory.token(tree)) return false; // it would never end
     _memory.keepToken(tree, reader.syncToken(), applied->isAnother);
+    if (applied->isAnother) _memory.noteChanges(changes->size());
     return true;
 }
 

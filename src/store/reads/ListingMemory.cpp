@@ -1,8 +1,22 @@
 #include "store/reads/ListingMemory.h"
 
+#include "store/reads/CacheText.h"
+
+#include <algorithm>
+#include <cstring>
 #include <utility>
 
 namespace rolvane {
+
+namespace {
+
+constexpr size_t kFewChanges = 200; // that a start may ask for
+
+bool isBelow(std::string_view container, std::string_view tree) {
+    return container.starts_with(tree) && (container.size() == tree.size() || container[tree.size()] == '/');
+}
+
+} // namespace
 
 ListingMemory::Container ListingMemory::packed(const Entries& entries) {
     Container out;
@@ -54,6 +68,7 @@ void ListingMemory::forgetAll() {
     _containers.clear();
     _tokens.clear();
     _bytes = 0;
+    _changes = 0;
 }
 
 void ListingMemory::forgetBelow(const Url& container) {
@@ -61,8 +76,7 @@ void ListingMemory::forgetBelow(const Url& container) {
     const std::lock_guard guard(_mutex);
     _tokens.erase(place);
     std::erase_if(_containers, [&](const auto& each) {
-        const bool goes =
-            each.first.starts_with(place) && (each.first.size() == place.size() || each.first[place.size()] == '/');
+        const bool goes = isBelow(each.first, place);
         if (goes) _bytes -= each.second.bytes();
         return goes;
     });
@@ -83,8 +97,11 @@ void ListingMemory::takeOver(const Url& tree, ListingMemory&& from) {
 
 void ListingMemory::keepToken(const Url& tree, const std::string& token, bool isAnother) {
     const std::lock_guard guard(_mutex);
-    Synced& synced = _tokens[tree.absoluteString()];
+    const auto [found, isNew] = _tokens.try_emplace(tree.absoluteString());
+    Synced& synced = found->second;
+    _isNew = _isNew || isNew;
     synced.token = token;
+    synced.isUsed = true;
     if (isAnother || synced.state == 0) synced.state = ++_lastState;
 }
 
@@ -92,6 +109,101 @@ uint64_t ListingMemory::stateOf(const Url& tree) const {
     const std::lock_guard guard(_mutex);
     const auto found = _tokens.find(tree.absoluteString());
     return found == _tokens.end() ? 0 : found->second.state;
+}
+
+void ListingMemory::noteChanges(size_t members) {
+    const std::lock_guard guard(_mutex);
+    _changes += members;
+}
+
+size_t ListingMemory::members() const {
+    size_t all = 0;
+    for (const auto& [url, container] : _containers) all += container.rows.size();
+    return all;
+}
+
+bool ListingMemory::isWorthSaving(bool atEnd) const {
+    const std::lock_guard guard(_mutex);
+    return _isNew || (atEnd && _changes > 0) || (_changes > kFewChanges && _changes > members() / 10);
+}
+
+void ListingMemory::wasSaved() {
+    const std::lock_guard guard(_mutex);
+    _isNew = false;
+    _changes = 0;
+}
+
+std::string ListingMemory::saved() const {
+    const std::lock_guard guard(_mutex);
+    std::string out;
+    out.reserve(_bytes + (_bytes >> 3));
+    for (const auto& [tree, synced] : _tokens) {
+        if (!synced.isUsed) continue;
+        std::vector<const std::pair<const std::string, Container>*> below;
+        for (const auto& each : _containers)
+            if (each.second.tag == kSynced && isBelow(each.first, tree)) below.push_back(&each);
+        cacheAppend(out, std::string_view(tree));
+        cacheAppend(out, std::string_view(synced.token));
+        cacheAppend(out, uint64_t{below.size()});
+        for (const auto* each : below) {
+            cacheAppend(out, std::string_view(each->first));
+            cacheAppend(out, std::string_view(each->second.text));
+            cacheAppend(out, uint64_t{each->second.rows.size()});
+            for (const Row& row : each->second.rows) {
+                uint64_t modified = 0;
+                std::memcpy(&modified, &row.modified, sizeof modified);
+                cacheAppend(out, uint64_t{row.at} << 32 | row.nameLength);
+                cacheAppend(out, uint64_t{row.tagLength} << 32 | (row.isCollection ? 1U : 0U) |
+                                     (row.hasDate ? 2U : 0U) | (row.hasLength ? 4U : 0U));
+                cacheAppend(out, modified);
+                cacheAppend(out, row.length);
+            }
+        }
+    }
+    return out;
+}
+
+bool ListingMemory::restore(std::string_view text) {
+    constexpr uint64_t kRowBytes = 32, kHalf = 0xffffffffU;
+    std::unordered_map<std::string, Container> containers;
+    std::unordered_map<std::string, Synced> tokens;
+    size_t bytes = 0;
+    for (CacheReader in(text); !in.atEnd();) {
+        const std::string tree(in.text());
+        tokens[tree].token = in.text();
+        uint64_t count = in.number();
+        for (; count > 0 && in.isWhole(); --count) {
+            const std::string url(in.text());
+            Container fresh;
+            fresh.tag = kSynced;
+            fresh.text = in.text();
+            CacheReader rows(in.bytes(std::min<uint64_t>(in.number(), text.size() / kRowBytes + 1) * kRowBytes));
+            while (!rows.atEnd()) {
+                const uint64_t where = rows.number(), what = rows.number(), modified = rows.number();
+                Row row{static_cast<uint32_t>(where >> 32),
+                        static_cast<uint32_t>(where & kHalf),
+                        static_cast<uint32_t>(what >> 32),
+                        (what & 1) != 0,
+                        (what & 2) != 0,
+                        (what & 4) != 0,
+                        0,
+                        rows.number()};
+                std::memcpy(&row.modified, &modified, sizeof modified);
+                if (uint64_t{row.at} + row.nameLength + row.tagLength > fresh.text.size()) return false;
+                fresh.rows.push_back(row);
+            }
+            bytes += fresh.bytes();
+            containers.insert_or_assign(url, std::move(fresh));
+        }
+        if (!in.isWhole() || tokens[tree].token.empty()) return false;
+    }
+    const std::lock_guard guard(_mutex);
+    if (!_containers.empty() || !_tokens.empty() || bytes > kMostBytes) return false;
+    for (auto& [tree, synced] : tokens) synced.state = ++_lastState;
+    _containers = std::move(containers);
+    _tokens = std::move(tokens);
+    _bytes = bytes;
+    return true;
 }
 
 std::string ListingMemory::token(const Url& tree) const {

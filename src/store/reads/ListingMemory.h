@@ -16,8 +16,8 @@
 namespace rolvane {
 
 // The members of collections as the store listed them last, each with the tag that it gave for the state of the
-// collection's members before that listing: a collection that still has the tag need not be listed again. In memory
-// only, bounded: past kMostBytes it forgets everything. Any thread.
+// collection's members before that listing: a collection that still has the tag need not be listed again. Bounded: past
+// kMostBytes it forgets everything. Any thread.
 class ListingMemory {
 public:
     using Entries = std::vector<std::pair<Url, MultistatusEntry>>; // direct members of the container
@@ -38,6 +38,18 @@ public:
     void keepToken(const Url& tree, const std::string& token, bool isAnother = true);
     std::string token(const Url& tree) const; // "" when there is none
     uint64_t stateOf(const Url& tree) const;  // another number for another state, in this process; 0 without a token
+
+    // For a file (CacheFile.h). A token and the containers below its tree stay true together, however old they are. So
+    // they are worth saving when a tree has come, when a tenth of all members has changed, and when the process ends.
+    void noteChanges(size_t members); // since they were saved
+    bool isWorthSaving(bool atEnd) const;
+    void wasSaved();
+    // The trees that have got a token in this process, each with its containers. Numbers as the machine has them.
+    //   text = tree*   tree = address token count:u64 container*   container = address text count:u64 row*
+    //   address, token, text = size:u64 bytes
+    std::string saved() const;
+    // Takes over what `saved` gave. False where the text is damaged; nothing is taken over then.
+    bool restore(std::string_view text);
     bool has(const Url& container, const std::string& tag) const;
     // The members, named below the container; nothing when it is not kept with this tag.
     std::optional<Entries> entries(const Url& container, const std::string& tag) const;
@@ -71,16 +83,20 @@ private:
     };
     static Member unpacked(const Container& container, const Row& row);
     static Container packed(const Entries& entries);
+    size_t members() const; // with the lock held
 
     mutable std::mutex _mutex; // guards the following
     std::unordered_map<std::string, Container> _containers;
     struct Synced {
         std::string token;
         uint64_t state = 0;
+        bool isUsed = false; // the store has given the token in this process
     };
     std::unordered_map<std::string, Synced> _tokens; // by tree
     uint64_t _lastState = 0;
     size_t _bytes = 0;
+    size_t _changes = 0; // members that have changed since it was saved
+    bool _isNew = false; // a tree has come that is in no file
 };
 
 } // namespace rolvane

@@ -336,6 +336,13 @@ bool VersionMemory::remembers(std::string_view url) {
     return _entries.contains(hash(url));
 }
 
+uint64_t VersionMemory::markOf(std::string_view url) {
+    std::lock_guard guard(_mutex);
+    need();
+    const auto found = _entries.find(hash(url));
+    return found != _entries.end() && found->second.kind == Kind::tag ? found->second.value : 0;
+}
+
 uint64_t VersionMemory::changes() {
     std::lock_guard guard(_mutex);
     return _changes;

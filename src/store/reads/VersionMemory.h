@@ -48,6 +48,9 @@ public:
     bool knows(std::string_view url, const FileVersion& version);
 
     bool remembers(std::string_view url); // some version of it
+    // A mark of the version: equal marks, in processes with the same file too, are of one entity tag. 0 where there is
+    // none, or no tag tells the version.
+    uint64_t markOf(std::string_view url);
 
     // Forgets everything, unless it was saved for this database, in this state or an earlier one.
     void belongTo(const Owner& owner);

@@ -1,0 +1,240 @@
+#include "store/reads/CacheFile.h"
+
+#include "RecordingTransport.h"
+#include "foundation/Paths.h"
+#include "store/dav/CXDAVManager.h"
+#include "store/reads/GroupCopies.h"
+#include "store/reads/ListingMemory.h"
+#include "support/TempHome.h"
+
+#include <filesystem>
+#include <gtest/gtest.h>
+#include <map>
+#include <rapidcheck/gtest.h>
+
+using namespace rolvane;
+using namespace rolvane::test;
+
+namespace {
+
+const Url kTree = *Url::parse("http://store.example.org/alice/Contacts");
+
+ListingMemory::Entries entriesBelow(const Url& container, size_t count, int version) {
+    ListingMemory::Entries all;
+    for (size_t i = 0; i < count; ++i) {
+        MultistatusEntry entry;
+        entry.etag = EntityTag("\"" + std::to_string(version) + "-" + std::to_string(i) + "\"");
+        if (i % 3) entry.lastModified = Date(1.7e9 + static_cast<double>(i));
+        if (i % 4) entry.length = i * 1000;
+        entry.isCollection = i % 5 == 4;
+        all.emplace_back(container.cxURLByAppendingComponent("ü" + std::to_string(i) + ":CXPerson"), entry);
+    }
+    return all;
+}
+
+std::string shown(const ListingMemory& memory, const Url& container) {
+    std::string out = memory.token(kTree) + "\n";
+    memory.forEach(container, ListingMemory::kSynced, [&](const ListingMemory::Member& m) {
+        out += std::string(m.encodedName) + " " + m.entry.etag.str() + " " +
+               (m.entry.lastModified ? m.entry.lastModified->toISO8601() : "-") + " " +
+               (m.entry.length ? std::to_string(*m.entry.length) : "-") + (m.entry.isCollection ? " c\n" : "\n");
+    });
+    return out;
+}
+
+// A store of one group, which counts what it is asked.
+struct GroupStore {
+    int version = 1;
+    std::map<std::string, int> asked;
+
+    std::shared_ptr<RecordingTransport> wire() {
+        auto made = std::make_shared<RecordingTransport>();
+        made->intercept([this](const HttpRequest& r) -> std::optional<HttpResponse> {
+            ++asked[r.method];
+            const std::string tag = "\"" + std::to_string(version) + "\"";
+            if (r.method == "OPTIONS") return answerOf(200, {{"dav", "1,2"}});
+            if (r.method == "GET")
+                return answerOf(200, {{"etag", tag}},
+                                "<plist version=\"1.0\"><dict><key>version</key><integer>" + std::to_string(version) +
+                                    "</integer></dict></plist>");
+            const std::string tree = "/dav/alice/Contacts";
+            if (r.url.encodedPath().find("People") != std::string::npos) return answerOf(404);
+            return answerOf(207, {{"date", "Tue, 14 Nov 2023 22:15:00 GMT"}},
+                            "<D:multistatus xmlns:D=\"DAV:\">" + response(tree + "/", "<D:collection/>", "") +
+                                response(tree + "/1:CXGroup", "", "<D:getetag>" + tag + "</D:getetag>") +
+                                "</D:multistatus>");
+        });
+        return made;
+    }
+    static std::string response(const std::string& href, const std::string& type, const std::string& more) {
+        return "<D:response><D:href>" + href + "</D:href><D:propstat><D:prop><D:resourcetype>" + type +
+               "</D:resourcetype>" + more + "</D:prop><D:status>HTTP/1.1 200 OK</D:status></D:propstat></D:response>";
+    }
+};
+
+// A daemon's client, from its start to its end.
+class Process {
+public:
+    Process(GroupStore& store, const std::string& directory, const std::string& user = "alice")
+        : _manager(account(user), store.wire(), CXDAVManager::VersionsFile{directory + "/versions"}),
+          _tree(_manager.account().baseLocationFor(UserName("alice"))) {
+        CXDAVError error;
+        EXPECT_TRUE(_manager.canReach(error)) << error.reason;
+        _manager.useVersionMemoryOf("database", 1);
+    }
+    int64_t groupSays() {
+        const CXDAVManager::Snapshot snapshot(_manager);
+        EXPECT_TRUE(_manager.infoForFilesInContainer(_tree));
+        const auto content = _manager.dictionaryAtURL(_tree.cxURLByAppendingComponent("1:CXGroup"), nullptr, false);
+        return content ? (*content)["version"].integer() : -1;
+    }
+    void save() { _manager.saveVersionMemory("database", 1); }
+    void revert() { _manager.revertVersionMemory(); }
+    void end() { _manager.processEnds(); }
+
+private:
+    static CXDAVAccount account(const std::string& user) {
+        CXDAVAccount a;
+        a.user = UserName(user);
+        a.endpoint = "https://store.example.org/dav/{user}/Contacts";
+        return a;
+    }
+    CXDAVManager _manager;
+    const Url _tree;
+};
+
+} // namespace
+
+TEST(CacheFile, GivesBackWhatWasWrittenToItsOwnerAlone) {
+    TempHome home;
+    const CacheFile file(home / "memory", "alice");
+    EXPECT_EQ(file.read(), "");
+    file.write(std::string("a\0b", 3));
+    EXPECT_EQ(file.read(), std::string("a\0b", 3));
+    EXPECT_EQ(CacheFile(home / "memory", "alic").read(), "");
+    EXPECT_EQ(CacheFile(home / "memory", "bobby").read(), "");
+}
+
+TEST(CacheFile, IsEmptyWhereAnyBitOfItIsDamaged) {
+    TempHome home;
+    const CacheFile file(home / "memory", "alice");
+    file.write("content that matters");
+    const std::string whole = readFile(home / "memory");
+    for (size_t at = 0; at < whole.size() * 8; ++at) {
+        std::string damaged = whole;
+        damaged[at / 8] = static_cast<char>(damaged[at / 8] ^ (1 << at % 8));
+        writeFileWhole(home / "memory", damaged);
+        ASSERT_EQ(file.read(), "") << at;
+    }
+    for (size_t size = 0; size < whole.size(); ++size) {
+        writeFileWhole(home / "memory", whole.substr(0, size));
+        ASSERT_EQ(file.read(), "") << size;
+    }
+}
+
+TEST(ListingMemory, IsTheSameBehindAFile) {
+    const Url people = kTree.cxURLByAppendingComponent("People");
+    ListingMemory memory, other, unused;
+    memory.keep(people, ListingMemory::kSynced, entriesBelow(people, 50, 1));
+    memory.keep(kTree, ListingMemory::kSynced, entriesBelow(kTree, 7, 1));
+    memory.keepToken(kTree, "urn:token:17");
+    ASSERT_TRUE(other.restore(memory.saved()));
+    for (const Url& container : {kTree, people}) EXPECT_EQ(shown(other, container), shown(memory, container));
+    EXPECT_NE(shown(other, people).find("urn:token:17\n"), std::string::npos);
+    EXPECT_EQ(other.saved(), "") << "nobody has used the tree in this process";
+    other.keepToken(kTree, "urn:token:18", false);
+    ASSERT_TRUE(unused.restore(other.saved()));
+    EXPECT_EQ(unused.token(kTree), "urn:token:18");
+}
+
+RC_GTEST_PROP(ListingMemory, TakesNothingOverFromADamagedText, ()) {
+    const Url people = kTree.cxURLByAppendingComponent("People");
+    ListingMemory memory;
+    memory.keep(people, ListingMemory::kSynced, entriesBelow(people, *rc::gen::inRange<size_t>(0, 9), 1));
+    memory.keepToken(kTree, "token");
+    std::string text = memory.saved();
+    const auto at = *rc::gen::inRange<size_t>(0, text.size());
+    if (*rc::gen::arbitrary<bool>())
+        text.resize(at);
+    else
+        text[at] = *rc::gen::arbitrary<char>();
+    ListingMemory other;
+    if (other.restore(text)) // whatever it says, all of it can be read
+        shown(other, people);
+    else
+        RC_ASSERT(other.token(kTree).empty());
+}
+
+TEST(ListingMemory, IsWorthSavingWithANewTreeAndThenWithATenthOfChanges) {
+    const Url people = kTree.cxURLByAppendingComponent("People");
+    ListingMemory memory;
+    EXPECT_FALSE(memory.isWorthSaving(true));
+    memory.keep(people, ListingMemory::kSynced, entriesBelow(people, 5000, 1));
+    memory.keepToken(kTree, "1");
+    EXPECT_TRUE(memory.isWorthSaving(false));
+    memory.wasSaved();
+    memory.keepToken(kTree, "2");
+    memory.noteChanges(499);
+    EXPECT_FALSE(memory.isWorthSaving(false)) << "an edit does not write a listing";
+    EXPECT_TRUE(memory.isWorthSaving(true));
+    memory.noteChanges(2);
+    EXPECT_TRUE(memory.isWorthSaving(false));
+}
+
+TEST(GroupCopies, OfAProcessThatHasEndedAreNotReadAgain) {
+    TempHome home;
+    GroupStore store;
+    {
+        Process first(store, home.path());
+        EXPECT_EQ(first.groupSays(), 1);
+        first.save();
+        first.end();
+    }
+    EXPECT_EQ(store.asked["GET"], 1);
+    {
+        Process second(store, home.path());
+        EXPECT_EQ(second.groupSays(), 1);
+        EXPECT_EQ(store.asked["GET"], 1);
+    }
+    Process stranger(store, home.path(), "bob");
+    EXPECT_EQ(stranger.groupSays(), 1);
+    EXPECT_EQ(store.asked["GET"], 2) << "another account reads for itself";
+}
+
+TEST(GroupCopies, OfAnotherVersionAreReadAgain) {
+    TempHome home;
+    GroupStore store;
+    {
+        Process first(store, home.path());
+        EXPECT_EQ(first.groupSays(), 1);
+        first.save();
+        first.end();
+    }
+    store.version = 2;
+    {
+        Process second(store, home.path());
+        EXPECT_EQ(second.groupSays(), 2);
+        second.end();
+    } // without a save: its version counts as not read
+    Process third(store, home.path());
+    EXPECT_EQ(third.groupSays(), 2);
+    EXPECT_EQ(store.asked["GET"], 3);
+}
+
+// The versions are those of before the failed pass, and what it read was another one.
+TEST(GroupCopies, OfAPassThatCouldNotBeStoredAreNotKept) {
+    TempHome home;
+    GroupStore store;
+    {
+        Process first(store, home.path());
+        EXPECT_EQ(first.groupSays(), 1);
+        first.save();
+        store.version = 2;
+        EXPECT_EQ(first.groupSays(), 2);
+        first.revert();
+        first.end();
+    }
+    store.version = 1; // the store was set back
+    Process second(store, home.path());
+    EXPECT_EQ(second.groupSays(), 1);
+}
