@@ -348,8 +348,14 @@ bool beginAnew(const std::string& directory, Head& head) {
     return !wrong && head.begin();
 }
 
-bool isOf(const SyncToken& token, const TreeJournal::Question& q, uint64_t epoch) {
-    return token.epoch == epoch && token.scope == q.scope && (token.isDeep || !q.isDeep);
+// A number that was not given yet: the notes were set back to an older copy, and will give it once more.
+bool isAhead(const SyncToken& token, int64_t last) {
+    return !token.cut && token.number > last;
+}
+
+bool isOf(const SyncToken& token, const TreeJournal::Question& q, const Head& head) {
+    return token.epoch == head.epoch && token.scope == q.scope && (token.isDeep || !q.isDeep) &&
+           !isAhead(token, head.last);
 }
 
 void fill(TreeJournal::Answer& answer, Look& look, const TreeJournal::Question& q, uint64_t epoch) {
@@ -392,7 +398,7 @@ TreeJournal::Answer TreeJournal::changes(const Question& question) const {
             return answer;
         }
         for (int attempt = 0;; ++attempt) {
-            if (question.from && !isOf(*question.from, question, head.epoch)) {
+            if (question.from && !isOf(*question.from, question, head)) {
                 answer.outcome = Outcome::invalidToken;
                 return answer;
             }

@@ -223,6 +223,23 @@ TEST_F(Journal, LostNotesMakeOlderTokensInvalid) {
     }
 }
 
+// Somebody has put an older copy of the store in its place, notes and all.
+TEST_F(Journal, NotesThatWereSetBackMakeLaterTokensInvalid) {
+    later = kHour;
+    write("a", "one");
+    const SyncToken former = ask(true, {}).token;
+    const std::string copy = home.path("copy");
+    fs::copy(journal, copy, fs::copy_options::recursive);
+    write("b", "two");
+    const SyncToken after = ask(true, former).token;
+    ASSERT_GT(after.number, former.number);
+    fs::remove_all(journal);
+    fs::rename(copy, journal);
+    fs::remove(tree / "b");
+    EXPECT_EQ(ask(true, after).outcome, Outcome::invalidToken);
+    EXPECT_EQ(ask(true, former).outcome, Outcome::told);
+}
+
 TEST_F(Journal, ManyDeparturesAreForgotten) {
     later = kHour;
     write("stays", "one");
