@@ -87,6 +87,7 @@ bench:
 	bench/bookput.py build/bench
 	BENCH_DOCS=docs/performance.md bench/onechange.py build/bench
 	BENCH_DOCS=docs/performance.md bench/news.py build/bench
+	BENCH_DOCS=docs/capacity.md bench/load.py build/bench
 
 lint:
 	@packaging/setup build test lint
