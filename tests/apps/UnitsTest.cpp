@@ -48,6 +48,53 @@ TEST(Units, AreNotConfinedByTheSettingsOfLongAgo) {
     EXPECT_FALSE(isConfined(directory / "dressed.service"));
 }
 
+// The units of the system's manager, by the names that the package installs them with.
+std::vector<std::string> storeUnits(const TempDirectory& directory) {
+    std::vector<std::string> files;
+    for (const auto& each : fs::directory_iterator(ROLVANE_SOURCE_DIR "/packaging/debian")) {
+        std::string name = each.path().filename();
+        if (!name.ends_with(".service") && !name.ends_with(".timer")) continue;
+        if (name.starts_with("rolvane-store.rolvane-")) name.erase(0, std::string("rolvane-store.").size());
+        std::string text = readFile(each.path());
+        for (size_t at; (at = text.find("/usr/bin/rolvane")) != std::string::npos;)
+            text.replace(at, std::string("/usr/bin/rolvane").size(), "/usr/bin/true"); // it is not installed here
+        std::ofstream(directory / name) << text;
+        files.push_back(directory / name);
+    }
+    return files;
+}
+
+int exposedTo(const std::string& unit) { // systemd-analyze's own threshold, in tenths
+    ChildProcess look({"systemd-analyze", "--offline=yes", "--no-pager", "--threshold=25", "security", unit});
+    const auto ending = look.wait(60);
+    return ending ? ending->status : -1;
+}
+
+TEST(StoreUnits, HaveAnExposureOfTwoAndAHalfAtMost) {
+    const TempDirectory directory;
+    size_t services = 0;
+    for (const std::string& file : storeUnits(directory))
+        if (file.ends_with(".service")) {
+            EXPECT_EQ(exposedTo(file), 0) << file;
+            ++services;
+        }
+    EXPECT_EQ(services, 2U);
+    std::ofstream(directory / "open.service") << "[Service]\nUser=nobody\nExecStart=/usr/bin/true\n";
+    EXPECT_EQ(exposedTo(directory / "open.service"), 1) << "the check does not see an open unit";
+}
+
+TEST(StoreUnits, AreWhatSystemdTakes) {
+    const TempDirectory directory;
+    std::vector<std::string> command{"systemd-analyze", "--man=no", "verify"};
+    for (const std::string& file : storeUnits(directory)) command.push_back(file);
+    ASSERT_EQ(command.size(), 6U) << "two services and a timer";
+    ChildProcess verify(command);
+    const auto ending = verify.wait(60);
+    ASSERT_TRUE(ending);
+    EXPECT_EQ(ending->status, 0) << verify.errors();
+    EXPECT_EQ(verify.errors(), "");
+}
+
 TEST(Units, AreWhatSystemdTakes) {
     const TempDirectory directory;
     std::vector<std::string> command{
