@@ -1,6 +1,6 @@
 // Core paths whose instructions are counted under callgrind: each with the same input, in a process of its own.
 //
-//   instructions DIRECTORY PATH     runs one path; what `rolvane_measured` calls is what counts
+//   instructions DIRECTORY PATH     runs one path; the instructions below `rolvane_measured` count
 //   instructions --list             the names of the paths
 //
 // The directory is empty and gets databases. `compare` beside this file counts, and compares with what is kept.
