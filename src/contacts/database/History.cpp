@@ -128,10 +128,18 @@ private:
         return _rolvane.impl().changeLog.isTouchedAfter(detail);
     }
 
+    // Whatever was changed since was taken back since.
+    bool isAsAdded(const CXChangeDetail& detail) {
+        std::lock_guard lock(_rolvane.impl().mutex);
+        const auto next = _rolvane.impl().changeLog.next(detail);
+        const std::optional<StoredRow> row = _rolvane.impl().store.row(detail.uniqueId);
+        return next && row && decoded(next->before) == decoded(row->properties);
+    }
+
     void remove(const CXChangeDetail& detail) {
         const CXRecordRef record = _rolvane.recordForUniqueId(detail.uniqueId);
         if (!record || !mayBeChanged(*record, detail)) return;
-        if (isTouchedAfter(detail)) return leave(detail, "stays: it was changed since.");
+        if (isTouchedAfter(detail) && !isAsAdded(detail)) return leave(detail, "stays: it was changed since.");
         if (record->valueForProperty(kCXRemoteLocationProperty) && !record->isSubscribed())
             return leave(detail, "stays: it is published. `rolvane unpublish --group` comes first.");
         _undone.removed += _rolvane.removeRecord(record);
