@@ -2,6 +2,7 @@
 #include "Context.h"
 #include "FailureText.h"
 #include "Terminal.h"
+#include "Texts.h"
 #include "ValueNames.h"
 
 #include "store/dav/CXDAVManager.h"
@@ -35,8 +36,8 @@ PasswordSource passwordSource(const AccountOptions& options, const CXDAVAccount&
     if (!options.passwordCredential.empty()) return {Kind::credential, options.passwordCredential};
     if (!options.passwordFile.empty()) return {Kind::file, absolutePath(options.passwordFile)};
     if (!options.askPassword && !options.keyring) return former;
-    const std::string password = readSecret("Password of " + user.str() + ": ");
-    if (password.empty()) throw CommandError(kUsage, "The password is empty. Nothing was changed.");
+    const std::string password = readSecret(tr("Password of {}: ", user.str()));
+    if (password.empty()) throw CommandError(kUsage, translated("The password is empty. Nothing was changed."));
     if (options.keyring) return keptInKeyring(account, password);
     return keptInFile(password);
 }
@@ -52,7 +53,8 @@ void setAccount(Context& context, CLI::App& command, const AccountOptions& optio
         if (const auto saved = savedAccount()) account = *saved;
     } catch (const CXException& error) { // one that cannot be used is replaced by a whole new one only
         if (!given("--user") || !given("--endpoint"))
-            throw CommandError(kFailed, error.reason() + " Make the account anew: give --user and --endpoint.");
+            throw CommandError(kFailed,
+                               error.reason() + translated(" Make the account anew: give --user and --endpoint."));
     }
     const std::string formerUser = account.user.str();
     if (given("--user")) account.user = UserName(options.user);
@@ -62,18 +64,19 @@ void setAccount(Context& context, CLI::App& command, const AccountOptions& optio
     if (given("--ca-file")) account.caFile = absolutePath(options.caFile);
     if (given("--authentication")) account.authentication = authenticationNamed(options.authentication);
     if (given("--plain-loopback")) account.plainLoopback = options.plainLoopback;
-    if (account.user.empty()) throw CommandError(kUsage, "Name the user with --user.");
+    if (account.user.empty()) throw CommandError(kUsage, translated("Name the user with --user."));
     if (const auto problem = account.problem()) throw CommandError(kUsage, *problem);
     account.passwordSource = passwordSource(options, account);
     if (const auto problem = account.problem()) throw CommandError(kUsage, *problem);
     if (given("--password-file")) requirePassword(account); // a file that cannot be used is better told now
     account.save();
-    context.say(fmt::format("The account of {} at {} is saved. `rolvane account test` tries it.", account.user.str(),
-                            account.endpoint));
+    context.say(
+        tr("The account of {} at {} is saved. `rolvane account test` tries it.", account.user.str(), account.endpoint));
     accountWasSaved(context);
     if (!formerUser.empty() && formerUser != account.user.str())
-        context.say("The account's user is another one than before: the next pass starts from nothing and compares "
-                    "everything.");
+        context.say(
+            translated("The account's user is another one than before: the next pass starts from nothing and compares "
+                       "everything."));
 }
 
 const char* sourceName(PasswordSource::Kind kind) {
@@ -104,14 +107,14 @@ void showAccount(Context& context) {
         {"caFile", account->caFile},
         {"plainLoopback", account->plainLoopback}};
     if (context.json) return context.print(data);
-    context.line(fmt::format("{:<15}{}", "User", account->user.str()));
-    context.line(fmt::format("{:<15}{}", "Endpoint", account->endpoint));
-    context.line(fmt::format("{:<15}{}", "Location", data["location"].get<std::string>()));
-    context.line(fmt::format("{:<15}{}", "Sign-in", authentication));
-    context.line(fmt::format("{:<15}{} {}", "Password", sourceName(account->passwordSource.kind),
-                             account->passwordSource.value));
-    if (!account->caFile.empty()) context.line(fmt::format("{:<15}{}", "Authority", account->caFile));
-    if (account->plainLoopback) context.line(fmt::format("{:<15}{}", "Transport", "plain http on this machine"));
+    context.row(translated("User"), account->user.str());
+    context.row(translated("Endpoint"), account->endpoint);
+    context.row(translated("Location"), data["location"].get<std::string>());
+    context.row(translated("Sign-in"), authentication);
+    context.row(translated("Password"),
+                fmt::format("{} {}", sourceName(account->passwordSource.kind), account->passwordSource.value));
+    if (!account->caFile.empty()) context.row(translated("Authority"), account->caFile);
+    if (account->plainLoopback) context.row(translated("Transport"), translated("plain http on this machine"));
 }
 
 // Signs in, tries what a publication does, and looks whether the tree is there. Exit code 5 for a refused login or
@@ -133,10 +136,10 @@ void testAccount(Context& context) {
                        {"published", structure},
                        {"trial", failure ? Json() : trialJson(trial)}});
     if (failure) throw CommandError(text.code, text.what + " " + text.toDo);
-    if (trial.hindrance) throw hinderedBy(*trial.hindrance, "Nothing can be published there.");
+    if (trial.hindrance) throw hinderedBy(*trial.hindrance, translated("Nothing can be published there."));
     for (const std::string& line : consequences(trial)) context.say(line);
-    context.say(structure ? "The store can be used, and the account's tree is there."
-                          : "The store can be used; the account has no tree there yet.");
+    context.say(structure ? translated("The store can be used, and the account's tree is there.")
+                          : translated("The store can be used; the account has no tree there yet."));
 }
 
 } // namespace

@@ -1,4 +1,5 @@
 #include "AccountTrial.h"
+#include "Texts.h"
 
 #include "daemon/DaemonControl.h"
 #include "daemon/RetrySchedule.h"
@@ -36,20 +37,21 @@ std::vector<std::string> consequences(const StoreTrial& trial) {
     std::vector<std::string> lines;
     if (!trial.locks && trial.conditions)
         lines.emplace_back(
-            "It keeps no locks: of two who change one file at once the second is told, and tries again.");
+            translated("It keeps no locks: of two who change one file at once the second is told, and tries again."));
     if (!trial.locks && !trial.conditions)
         lines.emplace_back(
-            "It keeps no locks and heeds no conditions: of two who change one file at once the later one "
-            "wins. Publish from one machine at a time.");
-    if (!trial.dates && trial.tags) lines.emplace_back("Its listings tell no dates: versions are told by their tags.");
+            translated("It keeps no locks and heeds no conditions: of two who change one file at once the later one "
+                       "wins. Publish from one machine at a time."));
+    if (!trial.dates && trial.tags)
+        lines.emplace_back(translated("Its listings tell no dates: versions are told by their tags."));
     if (trial.dates && !trial.tags)
-        lines.emplace_back("Its listings tell no tags: versions are told by date and size.");
+        lines.emplace_back(translated("Its listings tell no tags: versions are told by date and size."));
     if (!trial.dates && !trial.tags)
-        lines.emplace_back("Its listings tell neither dates nor tags: every pass reads everything.");
+        lines.emplace_back(translated("Its listings tell neither dates nor tags: every pass reads everything."));
     if (!trial.accessLists)
         lines.emplace_back(
-            "It keeps no access lists: who may read is the store's own matter, and `rolvane share` cannot "
-            "change it.");
+            translated("It keeps no access lists: who may read is the store's own matter, and `rolvane share` cannot "
+                       "change it."));
     return lines;
 }
 
@@ -70,10 +72,11 @@ std::string absolutePath(const std::string& path) {
 void accountWasSaved(Context& context) {
     if (const DaemonControl daemon; daemon.running()) {
         daemon.restart(); // it reads the account once
-        context.say("RolvaneManager was started anew with it.");
+        context.say(translated("RolvaneManager was started anew with it."));
     } else if (passwordWasRefused()) {
         daemon.start();
-        context.say("RolvaneManager, which had ended because the password was refused, runs again and goes on.");
+        context.say(
+            translated("RolvaneManager, which had ended because the password was refused, runs again and goes on."));
     }
 }
 

@@ -1,5 +1,7 @@
 #include "Archive.h"
 
+#include "Texts.h"
+
 #include "foundation/CXException.h"
 #include "foundation/TemporaryFiles.h"
 
@@ -101,20 +103,24 @@ public:
 
 private:
     [[noreturn]] static void fail() {
-        throw CXException(kCXFileException, "OpenSSL computes no SHA-256 digests here.");
+        throw CXException(kCXFileException, translated("OpenSSL computes no SHA-256 digests here."));
     }
     std::unique_ptr<EVP_MD_CTX, void (*)(EVP_MD_CTX*)> _context;
 };
 
-[[noreturn]] void cannot(const std::string& doing, const std::string& path) {
-    throw CXException(kCXFileException, fmt::format("{} could not be {}: {}.", path, doing, std::strerror(errno)));
+enum class Doing { reading, writing };
+
+[[noreturn]] void cannot(Doing doing, const std::string& path) {
+    const char* reason = std::strerror(errno);
+    throw CXException(kCXFileException, doing == Doing::reading ? tr("{} could not be read: {}.", path, reason)
+                                                                : tr("{} could not be written: {}.", path, reason));
 }
 
 void writeAll(int fd, std::string_view bytes, const std::string& path) {
     while (!bytes.empty()) {
         const ssize_t count = ::write(fd, bytes.data(), bytes.size());
         if (count < 0 && errno == EINTR) continue;
-        if (count < 0) cannot("written", path);
+        if (count < 0) cannot(Doing::writing, path);
         bytes.remove_prefix(static_cast<size_t>(count));
     }
 }
@@ -122,10 +128,10 @@ void writeAll(int fd, std::string_view bytes, const std::string& path) {
 int openForReading(const std::string& path) {
     const int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
     struct stat is {};
-    if (fd < 0 || ::fstat(fd, &is) != 0) cannot("read", path);
+    if (fd < 0 || ::fstat(fd, &is) != 0) cannot(Doing::reading, path);
     if (S_ISREG(is.st_mode)) return fd;
     ::close(fd);
-    throw CXException(kCXFileException, path + " is no plain file.");
+    throw CXException(kCXFileException, tr("{} is no plain file.", path));
 }
 
 } // namespace
@@ -135,7 +141,7 @@ int openForReading(const std::string& path) {
 ArchiveWriter::ArchiveWriter(std::string path, int64_t modified) : _path(std::move(path)), _modified(modified) {
     _temporary = _path + kTemporaryMark + "XXXXXX";
     _fd = ::mkostemp(_temporary.data(), O_CLOEXEC);
-    if (_fd < 0) cannot("written", _path);
+    if (_fd < 0) cannot(Doing::writing, _path);
     ::fchmod(_fd, 0600);
     ::flock(_fd, LOCK_EX | LOCK_NB); // says that somebody still writes it
 }
@@ -156,7 +162,7 @@ void ArchiveWriter::pad() {
 
 void ArchiveWriter::begin(const std::string& name, uint64_t size) {
     if (name.size() > kName.size || size >> 33)
-        throw CXException(kCXFileException, name + " is too large for a file of this form.");
+        throw CXException(kCXFileException, tr("{} is too large for a file of this form.", name));
     Header header{};
     put(header, kName, name);
     put(header, kMode, octal(0600, 7));
@@ -185,7 +191,7 @@ ArchivedFile ArchiveWriter::addFile(const std::string& name, const std::string& 
     const int fd = openForReading(path);
     const std::unique_ptr<const int, void (*)(const int*)> closing(&fd, [](const int* each) { ::close(*each); });
     struct stat is {};
-    if (::fstat(fd, &is) != 0) cannot("read", path);
+    if (::fstat(fd, &is) != 0) cannot(Doing::reading, path);
     const auto size = static_cast<uint64_t>(is.st_size);
     begin(name, size);
     ArchivedFile added{_written, size, {}};
@@ -195,8 +201,8 @@ ArchivedFile ArchiveWriter::addFile(const std::string& name, const std::string& 
     while (left > 0) {
         const ssize_t count = ::read(fd, piece.data(), std::min<uint64_t>(left, piece.size()));
         if (count < 0 && errno == EINTR) continue;
-        if (count < 0) cannot("read", path);
-        if (count == 0) throw CXException(kCXFileException, path + " became shorter while it was read.");
+        if (count < 0) cannot(Doing::reading, path);
+        if (count == 0) throw CXException(kCXFileException, tr("{} became shorter while it was read.", path));
         digest.add({piece.data(), static_cast<size_t>(count)});
         write({piece.data(), static_cast<size_t>(count)});
         left -= static_cast<uint64_t>(count);
@@ -208,11 +214,11 @@ ArchivedFile ArchiveWriter::addFile(const std::string& name, const std::string& 
 
 void ArchiveWriter::finish() {
     write(std::string(2 * kBlock, '\0'));
-    if (::fsync(_fd) != 0) cannot("written", _path);
+    if (::fsync(_fd) != 0) cannot(Doing::writing, _path);
 }
 
 void ArchiveWriter::publish() {
-    if (::rename(_temporary.c_str(), _path.c_str()) != 0) cannot("written", _path);
+    if (::rename(_temporary.c_str(), _path.c_str()) != 0) cannot(Doing::writing, _path);
     _temporary.clear();
     const std::string parent = std::filesystem::absolute(_path).parent_path();
     const int directory = ::open(parent.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
@@ -244,8 +250,8 @@ void ArchiveReader::readAt(uint64_t offset, char* into, size_t size) const {
     while (size > 0) {
         const ssize_t count = ::pread(_fd, into, size, static_cast<off_t>(offset));
         if (count < 0 && errno == EINTR) continue;
-        if (count < 0) cannot("read", _path);
-        if (count == 0) refuse("is not whole: its end is missing.");
+        if (count < 0) cannot(Doing::reading, _path);
+        if (count == 0) refuse(translated("is not whole: its end is missing."));
         into += count;
         offset += static_cast<uint64_t>(count);
         size -= static_cast<size_t>(count);
@@ -264,33 +270,35 @@ void ArchiveReader::forEachPiece(const ArchivedFile& member, const std::function
 
 void ArchiveReader::readMembers() {
     struct stat is {};
-    if (::fstat(_fd, &is) != 0) cannot("read", _path);
+    if (::fstat(_fd, &is) != 0) cannot(Doing::reading, _path);
     const auto end = static_cast<uint64_t>(is.st_size);
     for (uint64_t at = 0;;) {
-        if (end < at + kBlock) refuse(at == 0 ? "is no backup." : "is not whole: its end is missing.");
+        if (end < at + kBlock)
+            refuse(at == 0 ? translated("is no backup.") : translated("is not whole: its end is missing."));
         Header header{};
         readAt(at, header.data(), header.size());
         at += kBlock;
         if (std::all_of(header.begin(), header.end(), [](char c) { return c == '\0'; })) return;
-        if (get(header, kMagic) != kUstar) refuse(at == kBlock ? "is no backup." : "is damaged.");
+        if (get(header, kMagic) != kUstar)
+            refuse(at == kBlock ? translated("is no backup.") : translated("is damaged."));
         const auto size = numberOf(header, kSize);
-        if (numberOf(header, kChecksum) != checksumOf(header) || !size) refuse("is damaged.");
+        if (numberOf(header, kChecksum) != checksumOf(header) || !size) refuse(translated("is damaged."));
         const std::string name = textOf(header, kName);
         if (get(header, kKind) != "0" || !textOf(header, kPrefix).empty())
-            refuse("holds \"" + name + "\", which is no plain file.");
-        if (*size > end - at) refuse("is not whole: its end is missing.");
+            refuse(tr("holds \"{}\", which is no plain file.", name));
+        if (*size > end - at) refuse(translated("is not whole: its end is missing."));
         ArchivedFile member{at, *size, {}};
         Sha256 digest;
         forEachPiece(member, [&](std::string_view piece) { digest.add(piece); });
         member.sha256 = digest.hexadecimal();
-        if (!_members.emplace(name, member).second) refuse("holds \"" + name + "\" twice.");
+        if (!_members.emplace(name, member).second) refuse(tr("holds \"{}\" twice.", name));
         at += padded(*size);
     }
 }
 
 std::string ArchiveReader::text(const std::string& name, size_t most) const {
     const ArchivedFile& member = _members.at(name);
-    if (member.size > most) refuse("holds a \"" + name + "\" that is too long.");
+    if (member.size > most) refuse(tr("holds a \"{}\" that is too long.", name));
     std::string all;
     forEachPiece(member, [&](std::string_view piece) { all += piece; });
     return all;
@@ -298,11 +306,11 @@ std::string ArchiveReader::text(const std::string& name, size_t most) const {
 
 void ArchiveReader::extract(const std::string& name, const std::string& to) const {
     const int fd = ::open(to.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC | O_NOFOLLOW, 0600);
-    if (fd < 0) cannot("written", to);
+    if (fd < 0) cannot(Doing::writing, to);
     const std::unique_ptr<const int, void (*)(const int*)> closing(&fd, [](const int* each) { ::close(*each); });
     ::fchmod(fd, 0600);
     forEachPiece(_members.at(name), [&](std::string_view piece) { writeAll(fd, piece, to); });
-    if (::fsync(fd) != 0) cannot("written", to);
+    if (::fsync(fd) != 0) cannot(Doing::writing, to);
 }
 
 } // namespace rolvane::cli

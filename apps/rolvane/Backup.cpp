@@ -1,7 +1,7 @@
 #include "Backup.h"
 
-#include "Counted.h"
 #include "Subscriptions.h"
+#include "Texts.h"
 
 #include "contacts/database/CXRolvane.h"
 #include "contacts/database/DamagedDatabase.h"
@@ -137,7 +137,7 @@ void addAccount(Making& making, BackupFacts& facts, std::vector<std::string>& le
         if (!account->caFile.empty()) making.text(kAuthority, certificatesOf(account->caFile));
         facts.user = account->user.str();
     } catch (const CXException& error) {
-        left.push_back("The account is not in the backup. " + error.reason());
+        left.push_back(translated("The account is not in the backup. ") + error.reason());
     }
 }
 
@@ -172,7 +172,7 @@ void putInPlace(const std::string& made, const std::string& path) {
     fs::rename(made, path, error);
     if (error)
         throw CXException(kCXFileException,
-                          fmt::format("{} could not be put in its place: {}. Restore again.", path, error.message()));
+                          tr("{} could not be put in its place: {}. Restore again.", path, error.message()));
 }
 
 } // namespace
@@ -230,13 +230,13 @@ Backup::Backup(const std::string& path) : _archive(path), _path(path) {
 
 void Backup::readManifest() {
     const auto refuse = [&](const std::string& why) { throw CXException(kCXFileException, _path + " " + why); };
-    if (!_archive.has(kManifest)) refuse("is no backup: it has no list of its files.");
+    if (!_archive.has(kManifest)) refuse(translated("is no backup: it has no list of its files."));
     const Dictionary manifest = PropertyList::fromXML(_archive.text(kManifest)).dictionary();
     _facts.version = manifest["Version"].string();
     if (manifest["Format"].integer() > kFormat)
-        refuse(fmt::format("was made by a later version ({}). Install that version, or a later one, and restore again.",
-                           _facts.version));
-    if (manifest["Format"].integer() < 1) refuse("is no backup: its list of files has no format.");
+        refuse(tr("was made by a later version ({}). Install that version, or a later one, and restore again.",
+                  _facts.version));
+    if (manifest["Format"].integer() < 1) refuse(translated("is no backup: its list of files has no format."));
     if (const auto date = manifest["Date"].date()) _facts.date = *date;
     _facts.computer = manifest["Computer"].string();
     _configDirectory = manifest["ConfigDirectory"].string();
@@ -245,17 +245,17 @@ void Backup::readManifest() {
         if (name == kManifest) continue;
         const Dictionary listed = files[name].dictionary();
         if (listed["SHA256"].string() != member.sha256)
-            refuse(fmt::format("is damaged: \"{}\" is not what was saved. Use another backup.", name));
+            refuse(tr("is damaged: \"{}\" is not what was saved. Use another backup.", name));
         if (name.starts_with(kWithdrawn)) {
             if (!isPlainName(listed["Name"].string()))
-                refuse(fmt::format("holds a file called \"{}\".", listed["Name"].string()));
+                refuse(tr("holds a file called \"{}\".", listed["Name"].string()));
             _withdrawn.emplace_back(name, listed["Name"].string());
         } else if (name != kDatabase && name != kPreferences && name != kAccount && name != kAuthority) {
-            refuse(fmt::format("holds \"{}\", which no backup has.", name));
+            refuse(tr("holds \"{}\", which no backup has.", name));
         }
     }
     for (const auto& [name, listed] : files)
-        if (!_archive.has(name)) refuse(fmt::format("is damaged: \"{}\" is missing. Use another backup.", name));
+        if (!_archive.has(name)) refuse(tr("is damaged: \"{}\" is missing. Use another backup.", name));
     _facts.withdrawn = _withdrawn.size();
 }
 
@@ -263,7 +263,7 @@ void Backup::readManifest() {
 void Backup::checkDatabase() {
     const Workplace workplace(cacheDirectory());
     const auto wrong = [&](const std::string& what) {
-        throw CXException(kCXFileException, fmt::format("{} cannot be used. {}", _path, what));
+        throw CXException(kCXFileException, tr("{} cannot be used. {}", _path, what));
     };
     try {
         if (_facts.hasDatabase) {
@@ -273,7 +273,7 @@ void Backup::checkDatabase() {
             _facts.groups = counts.groups;
             Sqlite database(workplace / kDatabase, 0, throwDatabaseError);
             if (const std::string found = RecordStore(database).whatIsWrong(); !found.empty())
-                wrong("Its contact database is damaged: " + found + ".");
+                wrong(tr("Its contact database is damaged: {}.", found));
         }
         if (_facts.hasPreferences) {
             _archive.extract(kPreferences, workplace / kPreferences);
@@ -314,7 +314,7 @@ void Backup::restoreAccount() {
     auto account = CXDAVAccount::fromDictionary(PropertyList::fromXML(_archive.text(kAccount)).dictionary());
     if (!account.caFile.empty() && !fs::exists(account.caFile)) {
         if (!_archive.has(kAuthority))
-            throw CXException(kCXFileException, _path + " has an account without its authority.");
+            throw CXException(kCXFileException, tr("{} has an account without its authority.", _path));
         const std::string pem = _archive.text(kAuthority);
         const auto chain = certificatesIn(pem);
         std::string name = chain.empty() ? "restored" : chain.front().fingerprint.substr(0, 23);
@@ -336,22 +336,23 @@ std::string whatIsHere() {
             if (fs::file_size(databasePath()) == 0) throw CXException(kCXDatabaseException, "It is empty.");
             const Counts counts = countsOf(databasePath());
             if (counts.any()) {
-                parts.push_back(counted(counts.people, "person", "people"));
-                parts.push_back(counted(counts.groups, "group", "groups"));
+                parts.push_back(countedText(counts.people, "person", "people"));
+                parts.push_back(countedText(counts.groups, "group", "groups"));
             }
             if (counts.subscriptions > 0)
-                parts.push_back(counted(counts.subscriptions, "subscription", "subscriptions"));
+                parts.push_back(countedText(counts.subscriptions, "subscription", "subscriptions"));
         } catch (const CXException&) {
-            parts.emplace_back("a contact database that cannot be read");
+            parts.emplace_back(translated("a contact database that cannot be read"));
         }
     }
     try {
-        if (const auto account = CXDAVAccount::load()) parts.push_back("the account of " + account->user.str());
+        if (const auto account = CXDAVAccount::load()) parts.push_back(tr("the account of {}", account->user.str()));
     } catch (const CXException&) {
-        parts.emplace_back("an account that cannot be read");
+        parts.emplace_back(translated("an account that cannot be read"));
     }
     std::string text;
-    for (size_t i = 0; i < parts.size(); ++i) text += (i == 0 ? "" : i + 1 == parts.size() ? " and " : ", ") + parts[i];
+    for (size_t i = 0; i < parts.size(); ++i)
+        text += (i == 0 ? "" : i + 1 == parts.size() ? translated(" and ") : ", ") + parts[i];
     return text;
 }
 

@@ -3,7 +3,6 @@
 #include "Backup.h"
 #include "Books.h"
 #include "Consent.h"
-#include "Counted.h"
 #include "Subscriptions.h"
 #include "Texts.h"
 #include "ValueNames.h"
@@ -45,15 +44,16 @@ Json factsJson(const std::string& file, const BackupFacts& facts) {
 std::string contentsText(const BackupFacts& facts) {
     std::vector<std::string> parts;
     if (facts.hasDatabase) {
-        parts.push_back(counted(facts.people, "person", "people"));
-        parts.push_back(counted(facts.groups, "group", "groups"));
+        parts.push_back(countedText(facts.people, "person", "people"));
+        parts.push_back(countedText(facts.groups, "group", "groups"));
     }
-    if (!facts.user.empty()) parts.push_back("the account of " + facts.user);
-    if (facts.hasPreferences) parts.emplace_back("the preferences");
-    if (facts.withdrawn > 0) parts.emplace_back("what publishers have withdrawn");
-    if (parts.empty()) return "nothing";
+    if (!facts.user.empty()) parts.push_back(tr("the account of {}", facts.user));
+    if (facts.hasPreferences) parts.emplace_back(translated("the preferences"));
+    if (facts.withdrawn > 0) parts.emplace_back(translated("what publishers have withdrawn"));
+    if (parts.empty()) return translated("nothing");
     std::string text;
-    for (size_t i = 0; i < parts.size(); ++i) text += (i == 0 ? "" : i + 1 == parts.size() ? " and " : ", ") + parts[i];
+    for (size_t i = 0; i < parts.size(); ++i)
+        text += (i == 0 ? "" : i + 1 == parts.size() ? translated(" and ") : ", ") + parts[i];
     return text;
 }
 
@@ -61,17 +61,17 @@ void backUp(Context& context, const Options& options) {
     std::error_code error;
     const std::string file = fs::absolute(options.file);
     if (fs::is_directory(file, error))
-        throw CommandError(kUsage, fmt::format("{} is a directory. Name the file, such as {}/contacts.rolvane.",
-                                               options.file, options.file));
+        throw CommandError(
+            kUsage, tr("{} is a directory. Name the file, such as {}/contacts.rolvane.", options.file, options.file));
     if (fs::exists(file, error))
-        requireConsent(context, options.yes, fmt::format("Replace the file {}?", options.file),
-                       "It stays as it is, and nothing was backed up.");
+        requireConsent(context, options.yes, tr("Replace the file {}?", options.file),
+                       translated("It stays as it is, and nothing was backed up."));
     std::vector<std::string> left;
     const BackupFacts facts = writeBackup(file, left);
     for (const std::string& each : left) context.warn(each);
     if (context.json) context.print(factsJson(options.file, facts));
-    context.say(fmt::format("{} holds {}. It was read back, and it is whole. Passwords are not in it.", options.file,
-                            contentsText(facts)));
+    context.say(tr("{} holds {}. It was read back, and it is whole. Passwords are not in it.", options.file,
+                   contentsText(facts)));
     if (!left.empty()) context.exitCode = kPartly;
 }
 
@@ -94,7 +94,9 @@ private:
 // Nobody else starts a daemon while the files are exchanged.
 void exchange(Backup& backup) {
     const auto lock = InstanceLock::acquire(InstanceLock::defaultPath());
-    if (!lock) throw CommandError(kFailed, "RolvaneManager was started meanwhile. Nothing was restored; try again.");
+    if (!lock)
+        throw CommandError(kFailed,
+                           translated("RolvaneManager was started meanwhile. Nothing was restored; try again."));
     backup.restore();
 }
 
@@ -105,33 +107,35 @@ void tellNext(Context& context) {
         (void)account->password();
     } catch (const CXException&) {
         const bool keyring = account->passwordSource.kind == PasswordSource::Kind::keyring;
-        context.say(fmt::format(
+        context.say(tr(
             "The password of {} is in no backup: give it with `rolvane account set {}`, then `rolvane daemon start`.",
             account->user.str(), keyring ? "--keyring" : "--ask-password"));
         return;
     }
-    context.say("`rolvane doctor` looks at everything that sharing needs; `rolvane daemon start` goes on with it.");
+    context.say(
+        translated("`rolvane doctor` looks at everything that sharing needs; `rolvane daemon start` goes on with it."));
 }
 
 void restore(Context& context, const Options& options) {
     Backup backup(options.file);
     const BackupFacts& facts = backup.facts();
     const std::string here = whatIsHere(), held = contentsText(facts);
-    const std::string made = fmt::format("of {}{}", shownDate(facts.date),
-                                         facts.computer.empty() ? "" : " from the computer " + facts.computer);
+    const std::string made = facts.computer.empty()
+                                 ? tr("of {}", shownDate(facts.date))
+                                 : tr("of {} from the computer {}", shownDate(facts.date), facts.computer);
     if (options.dryRun) {
         if (context.json) {
             Json data = factsJson(options.file, facts);
             data["replaces"] = here.empty() ? Json() : Json(here);
             return context.print(data);
         }
-        context.line(fmt::format("{} is whole, {}. It holds {}.", options.file, made, held));
-        return context.line(here.empty() ? "There is nothing here that it would replace."
-                                         : fmt::format("It would replace {}.", here));
+        context.line(tr("{} is whole, {}. It holds {}.", options.file, made, held));
+        return context.line(here.empty() ? translated("There is nothing here that it would replace.")
+                                         : tr("It would replace {}.", here));
     }
     if (!here.empty())
-        requireConsent(context, options.yes, fmt::format("Replace {} by the backup {}, with {}?", here, made, held),
-                       "Nothing was restored.");
+        requireConsent(context, options.yes, tr("Replace {} by the backup {}, with {}?", here, made, held),
+                       translated("Nothing was restored."));
     const bool daemonRan = DaemonControl().stop();
     BooksRest books;
     const std::string kept = here.empty() ? "" : keepWhatIsHere(Clock::system().now());
@@ -142,11 +146,10 @@ void restore(Context& context, const Options& options) {
         data["kept"] = kept.empty() ? Json() : Json(kept);
         context.print(data);
     }
-    context.say(fmt::format("Restored: {}.", held));
+    context.say(tr("Restored: {}.", held));
     if (!kept.empty())
-        context.say(fmt::format("What was here before is kept in {}{}", kept,
-                                kept.ends_with(".rolvane") ? fmt::format("; `rolvane restore {}` brings it back.", kept)
-                                                           : "."));
+        context.say(tr("What was here before is kept in {}{}", kept,
+                       kept.ends_with(".rolvane") ? tr("; `rolvane restore {}` brings it back.", kept) : "."));
     if (daemonRan) DaemonControl().start();
     tellNext(context);
 }

@@ -1,6 +1,5 @@
 #include "Books.h"
 #include "BooksAutostart.h"
-#include "Counted.h"
 #include "QrCode.h"
 #include "Texts.h"
 #include "ValueNames.h"
@@ -37,7 +36,8 @@ Json devicesJson(const BooksDevices& devices) {
 }
 
 std::string lastUseText(const Json& device) {
-    return device["lastUse"].is_null() ? "never used" : "last used " + shownDate(device["lastUse"].get<std::string>());
+    return device["lastUse"].is_null() ? translated("never used")
+                                       : tr("last used {}", shownDate(device["lastUse"].get<std::string>()));
 }
 
 Json serverJson(const BooksServer& server, const BooksOptions& options) {
@@ -58,35 +58,33 @@ Json serverJson(const BooksServer& server, const BooksOptions& options) {
 }
 
 std::string onText(const Json& told) {
-    if (!told["on"].get<bool>()) return "off (`rolvane books on`)";
-    if (told["startedBy"].is_null()) return fmt::format("on, process {}", told["process"].get<int>());
-    return told["process"].is_null() ? "on; the first connection starts their server"
-                                     : fmt::format("on, process {}, started by systemd", told["process"].get<int>());
+    if (!told["on"].get<bool>()) return translated("off (`rolvane books on`)");
+    if (told["startedBy"].is_null()) return tr("on, process {}", told["process"].get<int>());
+    return told["process"].is_null() ? translated("on; the first connection starts their server")
+                                     : tr("on, process {}, started by systemd", told["process"].get<int>());
 }
 
 void tell(Context& context, const BooksServer& server, const BooksOptions& options) {
     const Json told = serverJson(server, options);
     if (context.json) return context.print(told);
-    const auto row = [&](const char* label, const std::string& text) {
-        context.line(fmt::format("{:<15}{}", label, text));
-    };
+    const auto row = [&](const char* label, const std::string& text) { context.row(label, text); };
     const auto rowIfAny = [&](const char* label, const char* key) {
         if (!told[key].is_null()) row(label, told[key].get<std::string>());
     };
-    row("Address books", onText(told));
-    rowIfAny("Address", "url");
-    rowIfAny("From elsewhere", "outsideURL");
-    rowIfAny("Authority", "caFile");
-    rowIfAny("Fingerprint", "fingerprint");
-    rowIfAny("Database", "database");
-    row("Log", told["errorLog"].get<std::string>());
-    if (told["devices"].empty()) row("Devices", "none (`rolvane books device add NAME`)");
-    const char* label = "Devices";
+    row(translated("Address books"), onText(told));
+    rowIfAny(translated("Address"), "url");
+    rowIfAny(translated("From elsewhere"), "outsideURL");
+    rowIfAny(translated("Authority"), "caFile");
+    rowIfAny(translated("Fingerprint"), "fingerprint");
+    rowIfAny(translated("Database"), "database");
+    row(translated("Log"), told["errorLog"].get<std::string>());
+    if (told["devices"].empty()) row(translated("Devices"), translated("none (`rolvane books device add NAME`)"));
+    const char* label = translated("Devices");
     for (const Json& device : told["devices"]) {
         row(label, fmt::format("{} ({})", device["name"].get<std::string>(), lastUseText(device)));
         label = "";
     }
-    for (const Json& link : told["links"]) row("Linked", linkText(link));
+    for (const Json& link : told["links"]) row(translated("Linked"), linkText(link));
 }
 
 void switchOn(Context& context, CLI::App& command, const ServerOptions& options) {
@@ -113,8 +111,9 @@ void switchOn(Context& context, CLI::App& command, const ServerOptions& options)
     if (options.directory.empty()) setBooksAutostart(!server.status().managed);
     tell(context, server, chosen);
     if (BooksDevices(server.stateDirectory()).all().empty())
-        context.say("Nobody can sign in yet: `rolvane books device add NAME` makes a password for each program or "
-                    "device.");
+        context.say(
+            translated("Nobody can sign in yet: `rolvane books device add NAME` makes a password for each program or "
+                       "device."));
 }
 
 void switchOff(Context& context, const ServerOptions& options) {
@@ -122,7 +121,8 @@ void switchOff(Context& context, const ServerOptions& options) {
     const bool wasOn = server.status().on;
     server.off();
     if (options.directory.empty()) setBooksAutostart(false);
-    context.say(wasOn ? "The address books are off; devices and contacts stay." : "The address books were off.");
+    context.say(wasOn ? translated("The address books are off; devices and contacts stay.")
+                      : translated("The address books were off."));
 }
 
 // A character that a URL's user part may not hold, as an escape.
@@ -147,9 +147,9 @@ void addDevice(Context& context, const ServerOptions& options) {
     const BooksDevices devices(server.stateDirectory());
     const bool known = devices.contains(options.device);
     if (known && !options.renew)
-        throw CommandError(kUsage, fmt::format("There is a device {} already. `--renew` gives it another password, and "
-                                               "the one that it has ends; or choose another name.",
-                                               options.device));
+        throw CommandError(kUsage, tr("There is a device {} already. `--renew` gives it another password, and "
+                                      "the one that it has ends; or choose another name.",
+                                      options.device));
     const std::string password = devices.add(options.device);
     const std::string link = signInLink(url, options.device, password);
     if (context.json)
@@ -158,27 +158,25 @@ void addDevice(Context& context, const ServerOptions& options) {
                               {"url", url},
                               {"link", link},
                               {"fingerprint", server.fingerprint().empty() ? Json() : Json(server.fingerprint())}});
-    const auto row = [&](const char* label, const std::string& text) {
-        context.line(fmt::format("{:<15}{}", label, text));
-    };
-    row("Address", url);
-    row("User name", options.device);
-    row("Password", password);
+    const auto row = [&](const char* label, const std::string& text) { context.row(label, text); };
+    row(translated("Address"), url);
+    row(translated("User name"), options.device);
+    row(translated("Password"), password);
     if (options.qr) {
-        std::cout << qrCode(link, context.dataIsTerminal());
+        showQrCode(context, link);
         if (outside.empty())
-            context.say("A phone does not reach this address: `rolvane books on --listen ADDRESS` opens the books to "
-                        "your network.");
+            context.say(translated(
+                "A phone does not reach this address: `rolvane books on --listen ADDRESS` opens the books to "
+                "your network."));
     }
-    context.say("The password is shown this once. `rolvane books device remove " + options.device + "` ends it.");
+    context.say(tr("The password is shown this once. `rolvane books device remove {}` ends it.", options.device));
 }
 
 void removeDevice(Context& context, const ServerOptions& options) {
     const BooksServer server(knownBooks(options.directory));
     if (!BooksDevices(server.stateDirectory()).remove(options.device))
-        throw CommandError(kNotFound,
-                           fmt::format("There is no device {}. `rolvane books devices` lists them.", options.device));
-    context.say(fmt::format("{} can no longer sign in.", options.device));
+        throw CommandError(kNotFound, tr("There is no device {}. `rolvane books devices` lists them.", options.device));
+    context.say(tr("{} can no longer sign in.", options.device));
 }
 
 void listDevices(Context& context, const ServerOptions& options) {
@@ -187,7 +185,7 @@ void listDevices(Context& context, const ServerOptions& options) {
     if (context.json) return context.print(devices);
     for (const Json& device : devices)
         context.line(fmt::format("{:<20}{}", device["name"].get<std::string>(), lastUseText(device)));
-    if (devices.empty()) context.say("No device can sign in. `rolvane books device add NAME` adds one.");
+    if (devices.empty()) context.say(translated("No device can sign in. `rolvane books device add NAME` adds one."));
 }
 
 } // namespace
@@ -212,8 +210,8 @@ nlohmann::ordered_json booksJson() {
 
 std::string booksText(const nlohmann::ordered_json& books) {
     if (books.is_null()) return {};
-    return fmt::format("{} at {}, {}", books["on"].get<bool>() ? "on" : "off", books["url"].get<std::string>(),
-                       counted(books["devices"].get<size_t>(), "device", "devices"));
+    return tr("{} at {}, {}", books["on"].get<bool>() ? translated("on") : translated("off"),
+              books["url"].get<std::string>(), countedText(books["devices"].get<size_t>(), "device", "devices"));
 }
 
 void addBooksCommands(CLI::App& app, Context& context) {

@@ -2,6 +2,7 @@
 #include "BooksLink.h"
 #include "Lookup.h"
 #include "Terminal.h"
+#include "Texts.h"
 #include "ValueNames.h"
 
 #include "contacts/records/Identifier.h"
@@ -48,16 +49,15 @@ void chooseBook(Context& context, const std::string& group, BooksLink::Settings&
     if (group.empty()) return;
     const CXGroupRef found = findGroup(context.database(), group);
     if (found->isSubscribed())
-        throw CommandError(
-            kRefused, fmt::format("{} is a copy of somebody else's group. Link a group of your own.", found->name()));
+        throw CommandError(kRefused,
+                           tr("{} is a copy of somebody else's group. Link a group of your own.", found->name()));
     settings.book = "group-" + std::string(cxUUIDPart(found->uniqueId()));
     settings.name = found->name();
 }
 
 void requireGood(const BooksLink& link, const BooksLink::Outcome& outcome) {
     if (!outcome.good)
-        throw CommandError(kFailed,
-                           fmt::format("{} could not be brought in step with {}: {} The log is {}.",
+        throw CommandError(kFailed, tr("{} could not be brought in step with {}: {} The log is {}.",
                                        link.settings().name, link.settings().url, outcome.message, link.logFile()));
 }
 
@@ -65,7 +65,8 @@ void link(Context& context, const LinkOptions& options) {
     const BooksOptions books = knownBooks();
     const BooksServer server(books);
     if (!server.status().on)
-        throw CommandError(kFailed, "The address books are off. `rolvane books on` switches them on; then link again.");
+        throw CommandError(
+            kFailed, translated("The address books are off. `rolvane books on` switches them on; then link again."));
     BooksLink::Settings settings{.book = {},
                                  .name = {},
                                  .url = options.url,
@@ -74,36 +75,36 @@ void link(Context& context, const LinkOptions& options) {
                                  .caFile = options.caFile};
     chooseBook(context, options.group, settings);
     if (!settings.url.starts_with("https://") && !settings.url.starts_with("http://"))
-        throw CommandError(kUsage, fmt::format("\"{}\" is no address of an address book: it begins with https:// (or "
-                                               "http://). The program or page that shows the other address book "
-                                               "tells it.",
-                                               settings.url));
+        throw CommandError(kUsage, tr("\"{}\" is no address of an address book: it begins with https:// (or "
+                                      "http://). The program or page that shows the other address book "
+                                      "tells it.",
+                                      settings.url));
     if (!settings.url.ends_with("/")) settings.url += '/';
     if (const auto there = BooksLink::of(books, settings.book))
-        throw CommandError(kUsage, fmt::format("{} is linked with {} already. `rolvane books unlink{}` ends that.",
-                                               settings.name, there->settings().url,
-                                               options.group.empty() ? "" : " --group " + options.group));
+        throw CommandError(kUsage,
+                           tr("{} is linked with {} already. `rolvane books unlink{}` ends that.", settings.name,
+                              there->settings().url, options.group.empty() ? "" : " --group " + options.group));
     std::string password;
     if (!settings.user.empty() && settings.passwordCommand.empty())
-        password = readSecret("Password of " + settings.user + " there: ");
+        password = readSecret(tr("Password of {} there: ", settings.user));
     const BooksLink made = BooksLink::make(books, settings, password);
     const BooksLink::Outcome outcome = made.run();
     if (!outcome.good) {
         const std::string log = made.logFile();
         made.remove();
-        throw CommandError(kFailed, fmt::format("{} could not be brought in step with {}: {} Nothing was linked.",
-                                                settings.name, settings.url, outcome.message));
+        throw CommandError(kFailed, tr("{} could not be brought in step with {}: {} Nothing was linked.", settings.name,
+                                       settings.url, outcome.message));
     }
-    context.say(fmt::format("{} is in step with {}.", settings.name, settings.url));
+    context.say(tr("{} is in step with {}.", settings.name, settings.url));
     if (!UserUnits::available()) {
-        context.say(fmt::format("There is no service manager here that would keep it so: run `{} books sync` now and "
-                                "then, for instance every five minutes by cron.",
-                                ownProgram()));
+        context.say(tr("There is no service manager here that would keep it so: run `{} books sync` now and "
+                       "then, for instance every five minutes by cron.",
+                       ownProgram()));
         return;
     }
     UserUnits::install(timerUnits());
     UserUnits::enable(kTimer);
-    context.say("It is kept so every five minutes.");
+    context.say(translated("It is kept so every five minutes."));
 }
 
 void unlink(Context& context, const LinkOptions& options) {
@@ -118,28 +119,27 @@ void unlink(Context& context, const LinkOptions& options) {
         if (named.name != options.group) throw;
     }
     const auto found = BooksLink::of(books, named.book);
-    if (!found) throw CommandError(kNotFound, fmt::format("{} is linked with nothing.", named.name));
+    if (!found) throw CommandError(kNotFound, tr("{} is linked with nothing.", named.name));
     found->remove();
     if (BooksLink::all(books).empty()) UserUnits::remove({kTimer, kService});
-    context.say(
-        fmt::format("{} is no longer kept in step with {}; both stay as they are.", named.name, found->settings().url));
+    context.say(tr("{} is no longer kept in step with {}; both stay as they are.", named.name, found->settings().url));
 }
 
 void syncAll(Context& context) {
     const std::vector<BooksLink> links = BooksLink::all(knownBooks());
-    if (links.empty()) throw CommandError(kNotFound, "No address book is linked. `rolvane books link URL` links one.");
+    if (links.empty())
+        throw CommandError(kNotFound, translated("No address book is linked. `rolvane books link URL` links one."));
     std::vector<std::pair<const BooksLink*, BooksLink::Outcome>> failed;
     for (const BooksLink& each : links) {
         const BooksLink::Outcome outcome = each.run();
         if (outcome.good)
-            context.say(fmt::format("{} is in step with {}.", each.settings().name, each.settings().url));
+            context.say(tr("{} is in step with {}.", each.settings().name, each.settings().url));
         else
             failed.emplace_back(&each, outcome);
     }
     for (const auto& [each, outcome] : failed) {
         if (each != failed.back().first)
-            context.warn(
-                fmt::format("rolvane: {} could not be brought in step: {}", each->settings().name, outcome.message));
+            context.warn(tr("rolvane: {} could not be brought in step: {}", each->settings().name, outcome.message));
         else
             requireGood(*each, outcome);
     }
@@ -148,7 +148,7 @@ void syncAll(Context& context) {
 // vdirsyncer calls this with the two versions of a card that both sides have changed, and wants two equal files.
 void mergeCards(const LinkOptions& options) {
     const std::string merged = mergedCards(readFile(options.cards.at(0)), readFile(options.cards.at(1)));
-    if (merged.empty()) throw CommandError(kFailed, "The two files are not two cards of one contact.");
+    if (merged.empty()) throw CommandError(kFailed, translated("The two files are not two cards of one contact."));
     for (const std::string& file : options.cards) writeFileWhole(file, merged);
 }
 
@@ -170,11 +170,12 @@ Json linksJson(const BooksOptions& books) {
 }
 
 std::string linkText(const Json& link) {
-    const std::string between = link["book"].get<std::string>() + " with " + link["url"].get<std::string>() + ": ";
-    if (link["lastRun"].is_null()) return between + "not yet in step";
-    if (link["good"].get<bool>()) return between + "in step " + link["lastRun"].get<std::string>();
-    return between + fmt::format("fails since {}: {}", link["failingSince"].get<std::string>(),
-                                 link["message"].get<std::string>());
+    const std::string book = link["book"], url = link["url"];
+    if (link["lastRun"].is_null()) return tr("{} with {}: not yet in step", book, url);
+    if (link["good"].get<bool>())
+        return tr("{} with {}: in step {}", book, url, shownDate(link["lastRun"].get<std::string>()));
+    return tr("{} with {}: fails since {}: {}", book, url, shownDate(link["failingSince"].get<std::string>()),
+              link["message"].get<std::string>());
 }
 
 void addBooksLinkCommands(CLI::App& books, Context& context) {

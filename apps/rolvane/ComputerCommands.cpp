@@ -1,6 +1,5 @@
 #include "Computers.h"
 #include "Consent.h"
-#include "Counted.h"
 #include "FailureText.h"
 #include "LeftOnStore.h"
 #include "PassReport.h"
@@ -9,6 +8,7 @@
 #include "PublishedAlready.h"
 #include "Shares.h"
 #include "Shown.h"
+#include "Texts.h"
 #include "ValueNames.h"
 
 #include "conduits/PublishedLayout.h"
@@ -57,8 +57,9 @@ std::optional<Lists> listsOf(CXDAVManager& store, const Url& base) {
     if (store.keepsAccessLists() == false) return std::nullopt;
     Lists lists;
     if (!store.ACLsAtURL(base, lists.readers, lists.writers))
-        throw CommandError(kUnreachable, "The store does not show with whom your contacts are shared. Nothing was "
-                                         "changed; try again later.");
+        throw CommandError(kUnreachable,
+                           translated("The store does not show with whom your contacts are shared. Nothing was "
+                                      "changed; try again later."));
     return lists;
 }
 
@@ -81,22 +82,23 @@ Meeting meeting(CXRolvane& database, const OwnTree& tree) {
 }
 
 std::string amountHere(const Meeting& of) {
-    return counted(of.peopleHere, "person", "people") + " and " + counted(of.groupsHere, "group", "groups");
+    return amountText(of.peopleHere, of.groupsHere);
 }
 
 std::string amountThere(const Meeting& of) {
-    return counted(of.peopleThere, "person", "people") + " and " + counted(of.groupsThere, "group", "groups");
+    return amountText(of.peopleThere, of.groupsThere);
 }
 
 std::string joinQuestion(const Meeting& of) {
-    std::string text = fmt::format("Join? {} come from the store.", amountThere(of));
+    std::string text = tr("Join? {} come from the store.", amountThere(of));
     if (of.peopleHere + of.groupsHere == 0) return text;
-    text += fmt::format(" The {} of this computer go there as well and are seen by everybody with whom you share",
-                        amountHere(of));
-    if (of.peopleOfBoth > 0)
-        text += fmt::format("; {} on both sides {} as the store has {}", counted(of.peopleOfBoth, "person", "people"),
-                            of.peopleOfBoth == 1 ? "becomes" : "become", of.peopleOfBoth == 1 ? "it" : "them");
-    return text + ". A vCard file of what is here now is kept.";
+    text +=
+        tr(" The {} of this computer go there as well and are seen by everybody with whom you share", amountHere(of));
+    if (of.peopleOfBoth == 1)
+        text += translated("; 1 person on both sides becomes as the store has it");
+    else if (of.peopleOfBoth > 1)
+        text += tr("; {} people on both sides become as the store has them", shownNumber(of.peopleOfBoth));
+    return text + translated(". A vCard file of what is here now is kept.");
 }
 
 // All that is here now, in a file of its own; "" where there is nothing.
@@ -131,12 +133,14 @@ bool isTakenIn(Preferences& preferences) {
 OwnTree requireTree(CXDAVManager& store) {
     OwnTree tree = lookAtOwnTree(store);
     if (tree.serial.empty())
-        throw CommandError(kNotFound, "Nothing of this account is published on its store. Publish on the other "
-                                      "computer first, with `rolvane publish`. Nothing was changed.");
+        throw CommandError(kNotFound,
+                           translated("Nothing of this account is published on its store. Publish on the other "
+                                      "computer first, with `rolvane publish`. Nothing was changed."));
     if (!tree.hasList)
-        throw CommandError(kRefused, "What is published of this account has no list of its contacts, or it cannot be "
-                                     "read just now. The computer that published it mends that: run `rolvane sync` "
-                                     "there. Nothing was changed.");
+        throw CommandError(kRefused,
+                           translated("What is published of this account has no list of its contacts, or it cannot be "
+                                      "read just now. The computer that published it mends that: run `rolvane sync` "
+                                      "there. Nothing was changed."));
     return tree;
 }
 
@@ -144,12 +148,14 @@ OwnTree requireTree(CXDAVManager& store) {
 bool keepsItAlready(CXRolvane& database, CXDAVManager& store) {
     const Publication publication(database);
     if (!publication.groups().empty())
-        throw CommandError(kRefused, "Single groups are published from this computer. Withdraw them first with "
-                                     "`rolvane unpublish`. Nothing was changed.");
+        throw CommandError(kRefused,
+                           translated("Single groups are published from this computer. Withdraw them first with "
+                                      "`rolvane unpublish`. Nothing was changed."));
     if (!publication.everything()) return false;
     if (publishedAlready(store, Preferences::shared(), true).by == PublishedAlready::By::thisComputer) return true;
-    throw CommandError(kRefused, "Contacts are published from this computer as another publication than the one on "
-                                 "the store. `rolvane unpublish --keep` ends it here; then join. Nothing was changed.");
+    throw CommandError(
+        kRefused, translated("Contacts are published from this computer as another publication than the one on "
+                             "the store. `rolvane unpublish --keep` ends it here; then join. Nothing was changed."));
 }
 
 void restartDaemon() {
@@ -159,13 +165,14 @@ void restartDaemon() {
 
 void join(Context& context, const JoinOptions& options) {
     const Url base = ownBase();
-    requireStore(context, "Nothing was changed.");
+    requireStore(context, translated("Nothing was changed."));
     CXDAVManager& store = CXDAVManager::defaultManager();
     CXRolvane& database = context.database();
     Preferences& preferences = Preferences::shared();
     if (LeftOnStore(database, preferences, base).anything())
-        throw CommandError(kRefused, "A withdrawal has not come to its end. Run `rolvane unpublish` again first. "
-                                     "Nothing was changed.");
+        throw CommandError(kRefused,
+                           translated("A withdrawal has not come to its end. Run `rolvane unpublish` again first. "
+                                      "Nothing was changed."));
     const OwnTree tree = requireTree(store);
     if (keepsItAlready(database, store)) {
         if (!isOneOfSeveral(preferences)) {
@@ -173,7 +180,7 @@ void join(Context& context, const JoinOptions& options) {
             becomeOneOfSeveral(preferences);
             restartDaemon();
         }
-        context.say("This computer keeps this publication in step already.");
+        context.say(translated("This computer keeps this publication in step already."));
         return;
     }
     const std::optional<Lists> lists = listsOf(store, base);
@@ -186,13 +193,12 @@ void join(Context& context, const JoinOptions& options) {
                                {"peopleThere", met.peopleThere},
                                {"groupsThere", met.groupsThere},
                                {"peopleOfBoth", met.peopleOfBoth}});
-        context.say(fmt::format("{} would come, and {} of this computer would go there; {} on both sides. Nothing was "
-                                "changed: this was a trial.",
-                                amountThere(met), amountHere(met),
-                                counted(met.peopleOfBoth, "person is", "people are")));
+        context.say(tr("{} would come, and {} of this computer would go there; {} on both sides. Nothing was "
+                       "changed: this was a trial.",
+                       amountThere(met), amountHere(met), countedText(met.peopleOfBoth, "person is", "people are")));
         return;
     }
-    requireConsent(context, options.yes, joinQuestion(met), "Nothing was changed.");
+    requireConsent(context, options.yes, joinQuestion(met), translated("Nothing was changed."));
 
     const DaemonControl daemon;
     const bool ran = daemon.stop();
@@ -209,11 +215,12 @@ void join(Context& context, const JoinOptions& options) {
         if (ran) daemon.start();
         throw;
     }
-    if (!kept.empty()) context.say(fmt::format("What was here before is kept in {}.", kept));
+    if (!kept.empty()) context.say(tr("What was here before is kept in {}.", kept));
     PassWatch watch(context, !context.quiet);
     OutcomeWatch outcomes(context);
     daemon.start();
-    PassOutcome outcome = waitForPass(context, watch, outcomes, "Joining", database.journalPosition(), options.timeout);
+    PassOutcome outcome =
+        waitForPass(context, watch, outcomes, translated("Joining"), database.journalPosition(), options.timeout);
     constexpr int kMostPasses = 5;
     for (int passes = 0; passes < kMostPasses && !isTakenIn(preferences) && outcome.storeReached; ++passes)
         outcome = makePass(context, options.timeout);
@@ -226,14 +233,14 @@ void join(Context& context, const JoinOptions& options) {
                            {"kept", kept.empty() ? Json() : Json(kept)},
                            {"pass", outcomeJson(outcome)}});
     if (!done) {
-        context.warn("Not all of it has come yet. Nothing of this computer goes to the store before it has; "
-                     "`rolvane sync` goes on.");
+        context.warn(translated("Not all of it has come yet. Nothing of this computer goes to the store before it has; "
+                                "`rolvane sync` goes on."));
         if (well) context.exitCode = kFailed;
         return;
     }
-    context.say(fmt::format("This computer is in step with the others: {} are here.",
-                            counted(database.countPeople(RemoteLocation("")), "person", "people") + " and " +
-                                counted(database.listGroups(RemoteLocation("")).size(), "group", "groups")));
+    context.say(
+        tr("This computer is in step with the others: {} are here.",
+           amountText(database.countPeople(RemoteLocation("")), database.listGroups(RemoteLocation("")).size())));
 }
 
 // computers --------------------------------------------------------------------------------------------------------
@@ -243,7 +250,7 @@ void rename(Context& context, const std::string& name) {
     preferences.set(kDaemonDomain, kCXDComputerName, name);
     preferences.remove(kDaemonDomain, kCXDToldOfItself); // the next pass tells the name
     preferences.synchronize(kDaemonDomain);
-    context.say(fmt::format("This computer is called \"{}\" from its next pass on.", name));
+    context.say(tr("This computer is called \"{}\" from its next pass on.", name));
 }
 
 void listComputers(Context& context) {
@@ -251,21 +258,21 @@ void listComputers(Context& context) {
     Preferences& preferences = Preferences::shared();
     std::vector<Computer> all = computersOfValue(preferences.get(kDaemonDomain, kCXDComputers));
     if (const auto failure = testStore())
-        context.warn(fmt::format("The store cannot be asked just now. {} These are the computers as they were seen "
-                                 "last.",
-                                 failureText(*failure, sceneOfTheAccount(Clock::system().now())).what));
+        context.warn(tr("The store cannot be asked just now. {} These are the computers as they were seen "
+                        "last.",
+                        failureText(*failure, sceneOfTheAccount(Clock::system().now())).what));
     else
         all = lookAtOwnTree(CXDAVManager::defaultManager()).computers;
     if (context.json) return context.print(computersJson(preferences, all));
     const std::string self = thisComputer(preferences).id;
     for (const Computer& each : all)
         context.line(fmt::format("{}  {}{}", each.name,
-                                 each.seen ? "last there " + each.seen->toISO8601() : "published",
-                                 each.id == self ? "  (this computer)" : ""));
+                                 each.seen ? tr("last there {}", shownDate(*each.seen)) : translated("published"),
+                                 each.id == self ? translated("  (this computer)") : ""));
     if (all.empty())
         context.say(
-            "No computer has told of itself. `rolvane publish` does so on the first one, `rolvane join` on each "
-            "further one.");
+            translated("No computer has told of itself. `rolvane publish` does so on the first one, `rolvane join` on "
+                       "each further one."));
 }
 
 // leave ------------------------------------------------------------------------------------------------------------
@@ -276,24 +283,24 @@ struct LeaveOptions {
 };
 
 void forgetOther(Context& context, const std::string& name) {
-    requireStore(context, "Nothing was changed.");
+    requireStore(context, translated("Nothing was changed."));
     CXDAVManager& store = CXDAVManager::defaultManager();
     Preferences& preferences = Preferences::shared();
     const std::string self = thisComputer(preferences).id;
     std::vector<Computer> all = lookAtOwnTree(store).computers;
     std::erase_if(all, [&](const Computer& each) { return each.id == self || (each.name != name && each.id != name); });
-    if (all.empty()) throw CommandError(kNotFound, fmt::format("No other computer is called \"{}\".", name));
+    if (all.empty()) throw CommandError(kNotFound, tr("No other computer is called \"{}\".", name));
     if (all.size() > 1)
-        throw CommandError(kNotFound, fmt::format("{} computers are called \"{}\". `rolvane computers --json` tells "
-                                                  "their identifiers, which name one of them.",
-                                                  all.size(), name));
+        throw CommandError(kNotFound, tr("{} computers are called \"{}\". `rolvane computers --json` tells "
+                                         "their identifiers, which name one of them.",
+                                         all.size(), name));
     ComputersOnStore onStore(store, ownBase());
     if (!onStore.remove(all.front().id))
-        throw CommandError(kUnreachable, "The list of computers could not be written. Try again later.");
+        throw CommandError(kUnreachable, translated("The list of computers could not be written. Try again later."));
     const auto left = onStore.read();
     if (left && std::all_of(left->begin(), left->end(), [&](const Computer& each) { return each.id == self; }))
         becomeTheOnlyOne(preferences);
-    context.say(fmt::format("\"{}\" is no longer listed. Should it still run, its next pass lists it again.", name));
+    context.say(tr("\"{}\" is no longer listed. Should it still run, its next pass lists it again.", name));
 }
 
 void leave(Context& context, const LeaveOptions& options) {
@@ -302,16 +309,18 @@ void leave(Context& context, const LeaveOptions& options) {
     CXRolvane& database = context.database();
     Preferences& preferences = Preferences::shared();
     if (!isOneOfSeveral(preferences))
-        throw CommandError(kRefused, "This computer keeps its contacts in step with no other one. `rolvane unpublish` "
-                                     "takes them off the store.");
+        throw CommandError(kRefused,
+                           translated("This computer keeps its contacts in step with no other one. `rolvane unpublish` "
+                                      "takes them off the store."));
     if (otherComputers(preferences).empty())
-        throw CommandError(kRefused, "No other computer keeps these contacts on the store in step. `rolvane unpublish` "
-                                     "takes them off the store.");
+        throw CommandError(
+            kRefused, translated("No other computer keeps these contacts on the store in step. `rolvane unpublish` "
+                                 "takes them off the store."));
     requireConsent(context, options.yes,
-                   fmt::format("Leave? The contacts stay here and on the store; what is changed here from now on does "
-                               "not go to {}, nor to anybody with whom you share.",
-                               computersText(otherComputers(preferences))),
-                   "Nothing was changed.");
+                   tr("Leave? The contacts stay here and on the store; what is changed here from now on does "
+                      "not go to {}, nor to anybody with whom you share.",
+                      computersText(otherComputers(preferences))),
+                   translated("Nothing was changed."));
     const DaemonControl daemon;
     const bool ran = daemon.stop();
     try {
@@ -326,11 +335,12 @@ void leave(Context& context, const LeaveOptions& options) {
     CXDAVManager& store = CXDAVManager::defaultManager();
     store.mendOwnTreeOnly(true);
     if (testStore() || !ComputersOnStore(store, base).remove(thisComputer(preferences).id))
-        context.warn("The store could not be told: the other computers go on listing this one. `rolvane leave "
-                     "--computer NAME` takes it off their list.");
+        context.warn(
+            translated("The store could not be told: the other computers go on listing this one. `rolvane leave "
+                       "--computer NAME` takes it off their list."));
     if (ran) daemon.start();
-    context.say(fmt::format("This computer keeps its {} to itself from now on.",
-                            counted(database.countPeople(RemoteLocation("")), "person", "people")));
+    context.say(tr("This computer keeps its {} to itself from now on.",
+                   countedText(database.countPeople(RemoteLocation("")), "person", "people")));
 }
 
 } // namespace
@@ -346,14 +356,14 @@ std::vector<Computer> otherComputers(Preferences& preferences) {
 
 std::string computerText(const Computer& computer) {
     return fmt::format("\"{}\"{}", computer.name,
-                       computer.seen ? " (last there " + computer.seen->toISO8601() + ")" : "");
+                       computer.seen ? tr(" (last there {})", shownDate(*computer.seen)) : "");
 }
 
 std::string computersText(const std::vector<Computer>& computers) {
-    if (computers.empty()) return "another computer";
+    if (computers.empty()) return translated("another computer");
     std::string text;
     for (size_t i = 0; i < computers.size(); ++i)
-        text += (i == 0 ? "" : i + 1 < computers.size() ? ", " : " and ") + computerText(computers[i]);
+        text += (i == 0 ? "" : i + 1 < computers.size() ? ", " : translated(" and ")) + computerText(computers[i]);
     return text;
 }
 
@@ -401,11 +411,11 @@ void requireOwnTree(CXDAVManager& store, Preferences& preferences) {
     const bool wasOurs = tree.serial == preferences.get(kDaemonDomain, kCXDFormerTree).string();
     if (tree.computers.empty() && (namesUs || wasOurs)) return;
     throw CommandError(kRefused,
-                       fmt::format("{} and {} of this account are published already, from {}. `rolvane join` brings "
-                                   "them here and keeps both in step; `rolvane publish --replace` publishes over them. "
-                                   "Nothing was published.",
-                                   counted(tree.people.size(), "person", "people"),
-                                   counted(tree.groups.size(), "group", "groups"), computersText(tree.computers)));
+                       tr("{} and {} of this account are published already, from {}. `rolvane join` brings "
+                          "them here and keeps both in step; `rolvane publish --replace` publishes over them. "
+                          "Nothing was published.",
+                          countedText(tree.people.size(), "person", "people"),
+                          countedText(tree.groups.size(), "group", "groups"), computersText(tree.computers)));
 }
 
 // The store knows of one that joined a moment ago. Where it cannot be asked, what the daemon saw last counts.
@@ -420,12 +430,12 @@ void requireNoOtherComputer(CXDAVManager& store, Preferences& preferences) {
             others = *listed;
         }
     if (!may) return;
-    throw CommandError(
-        kRefused, fmt::format("These contacts are kept in step with {}, and would leave the store for all of them. "
-                              "`rolvane leave` takes this computer out alone; `rolvane unpublish --all-computers` "
-                              "takes them off the store; `rolvane leave --computer NAME` forgets one that is gone. "
-                              "Everything is still published.",
-                              computersText(others)));
+    throw CommandError(kRefused,
+                       tr("These contacts are kept in step with {}, and would leave the store for all of them. "
+                          "`rolvane leave` takes this computer out alone; `rolvane unpublish --all-computers` "
+                          "takes them off the store; `rolvane leave --computer NAME` forgets one that is gone. "
+                          "Everything is still published.",
+                          computersText(others)));
 }
 
 void noteThisComputer(CXDAVManager& store, Preferences& preferences) {

@@ -18,8 +18,8 @@ constexpr size_t kShown = 60; // characters of a value in a line
 
 std::string shown(const Dictionary& values, const std::string& property) {
     const Value& value = values[property];
-    if (!value) return values.empty() ? "no value" : shown(values, values.begin()->first);
-    if (value.isData()) return fmt::format("{} bytes", value.data().size());
+    if (!value) return values.empty() ? translated("no value") : shown(values, values.begin()->first);
+    if (value.isData()) return tr("{} bytes", value.data().size());
     std::string text = value.isString() ? value.string() : toJson(value).dump();
     for (char& c : text)
         if (static_cast<unsigned char>(c) < 0x20) c = ' ';
@@ -45,13 +45,13 @@ Json conflictJson(const CXConflict& conflict) {
 
 CXConflict findConflict(Context& context, int64_t number) {
     if (auto found = context.database().conflict(number)) return *found;
-    throw CommandError(kNotFound, fmt::format("There is no conflict {}. `rolvane conflicts list` lists them.", number));
+    throw CommandError(kNotFound, tr("There is no conflict {}. `rolvane conflicts list` lists them.", number));
 }
 
 void listConflicts(Context& context) {
     const Json all = conflictsJson(context.database());
     if (context.json) return context.print(all);
-    if (all.empty()) context.say("No value gave way to another one.");
+    if (all.empty()) context.say(translated("No value gave way to another one."));
     for (const Json& each : all)
         context.line(fmt::format("{:>4}  {}", each["number"].get<int64_t>(), conflictText(each)));
 }
@@ -62,9 +62,9 @@ void restoreConflict(Context& context, int64_t number) {
     const CXRecordRef record = database.recordForUniqueId(conflict.uniqueId);
     const CXMergeConflict& merge = conflict.merge;
     if (!record)
-        throw CommandError(kNotFound, fmt::format("{} is no longer there. The value was {}; `rolvane conflicts list "
-                                                  "--json` has it whole.",
-                                                  conflict.name, shown(merge.lost, merge.property)));
+        throw CommandError(kNotFound, tr("{} is no longer there. The value was {}; `rolvane conflicts list "
+                                         "--json` has it whole.",
+                                         conflict.name, shown(merge.lost, merge.property)));
     if (const std::string reason = record->readOnlyReason(); !reason.empty()) throw CommandError(kRefused, reason);
     Dictionary replaced;
     for (const Dictionary& values : {merge.kept, merge.lost})
@@ -74,15 +74,15 @@ void restoreConflict(Context& context, int64_t number) {
         }
     database.save();
     database.forgetConflict(number);
-    context.say(fmt::format("{} of {} is {} again. It was {}.", merge.property, conflict.name,
-                            shown(merge.lost, merge.property), shown(replaced, merge.property)));
+    context.say(tr("{} of {} is {} again. It was {}.", merge.property, conflict.name, shown(merge.lost, merge.property),
+                   shown(replaced, merge.property)));
 }
 
 void forgetConflict(Context& context, int64_t number) {
     const CXConflict conflict = findConflict(context, number);
     context.database().forgetConflict(number);
-    context.say(fmt::format("Conflict {} is forgotten: {} of {} stays as it is.", number, conflict.merge.property,
-                            conflict.name));
+    context.say(
+        tr("Conflict {} is forgotten: {} of {} stays as it is.", number, conflict.merge.property, conflict.name));
 }
 
 } // namespace
@@ -94,10 +94,10 @@ Json conflictsJson(CXRolvane& database) {
 }
 
 std::string conflictText(const Json& conflict) {
-    return fmt::format("{} of {}: {} was kept, {} {} gave way, on {}", conflict["property"].get<std::string>(),
-                       conflict["name"].get<std::string>(), conflict["keptText"].get<std::string>(),
-                       conflict["own"].get<bool>() ? "your" : "the other", conflict["lostText"].get<std::string>(),
-                       shownDate(conflict["date"].get<std::string>()));
+    return tr("{} of {}: {} was kept, {} {} gave way, on {}", conflict["property"].get<std::string>(),
+              conflict["name"].get<std::string>(), conflict["keptText"].get<std::string>(),
+              conflict["own"].get<bool>() ? translated("your") : translated("the other"),
+              conflict["lostText"].get<std::string>(), shownDate(conflict["date"].get<std::string>()));
 }
 
 void addConflictCommands(CLI::App& app, Context& context) {

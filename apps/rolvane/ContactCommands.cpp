@@ -1,6 +1,5 @@
 #include "Consent.h"
 #include "Context.h"
-#include "Counted.h"
 #include "ImportReport.h"
 #include "Lookup.h"
 #include "PersonFields.h"
@@ -10,6 +9,7 @@
 #include "Shares.h"
 #include "Shown.h"
 #include "Subscriptions.h"
+#include "Texts.h"
 #include "ValueNames.h"
 
 #include "contacts/database/History.h"
@@ -48,23 +48,23 @@ struct ImportOptions {
 
 void importCards(Context& context, const ImportOptions& options) {
     if (!options.charset.empty() && !isKnownCharset(options.charset))
-        throw CommandError(kUsage, fmt::format("There is no character set \"{}\". `iconv --list` names those that "
-                                               "there are.",
-                                               options.charset));
+        throw CommandError(kUsage, tr("There is no character set \"{}\". `iconv --list` names those that "
+                                      "there are.",
+                                      options.charset));
     VCardImportReport report;
     size_t unreadable = 0; // files
     {
-        ProgressBar bar(context, "Importing");
+        ProgressBar bar(context, translated("Importing"));
         VCardImport import(context.database(), [&](const VCardProgress& progress) {
             if (progress.bytesTotal > 0)
                 bar.update(static_cast<double>(progress.bytesDone) / static_cast<double>(progress.bytesTotal),
-                           counted(progress.cards, "contact", "contacts"));
+                           countedText(progress.cards, "contact", "contacts"));
         });
         import.setCharset(options.charset);
         import.setDryRun(options.dryRun);
         for (const std::string& file : options.files) try {
                 if (file == "-")
-                    import.addStream(std::cin, "standard input");
+                    import.addStream(std::cin, translated("standard input"));
                 else
                     import.addFile(file);
             } catch (const CXException& error) {
@@ -77,8 +77,8 @@ void importCards(Context& context, const ImportOptions& options) {
     reportImport(context, report, unreadable, options.dryRun);
     const std::vector<std::string> readers = Shares(context.database()).readers();
     if (options.dryRun && report.imported > 0 && !readers.empty() && Publication(context.database()).everything())
-        context.say(fmt::format("All your contacts are published: {} would become readable for {}.",
-                                counted(report.imported, "person", "people"), usersText(readers)));
+        context.say(tr("All your contacts are published: {} would become readable for {}.",
+                       countedText(report.imported, "person", "people"), usersText(readers)));
 }
 
 // export ---------------------------------------------------------------------------------------------------------
@@ -101,7 +101,7 @@ public:
         if (!_stream) {
             const std::string reason = std::strerror(errno);
             _written = _path;
-            throw CommandError(kFailed, fmt::format("{} cannot be written ({}).", _path, reason));
+            throw CommandError(kFailed, tr("{} cannot be written ({}).", _path, reason));
         }
     }
     ~OutputFile() {
@@ -113,9 +113,9 @@ public:
     void finish() {
         _stream.close();
         if (!_stream || (_written != _path && std::rename(_written.c_str(), _path.c_str()) != 0))
-            throw CommandError(kFailed, fmt::format("{} could not be written whole ({}). What was there before is as "
-                                                    "it was.",
-                                                    _path, std::strerror(errno)));
+            throw CommandError(kFailed, tr("{} could not be written whole ({}). What was there before is as "
+                                           "it was.",
+                                           _path, std::strerror(errno)));
         _written = _path;
     }
 
@@ -126,7 +126,7 @@ private:
 
 size_t exportTo(Context& context, const ExportOptions& options, std::ostream& out) {
     CXRolvane& database = context.database();
-    ProgressBar bar(context, "Exporting");
+    ProgressBar bar(context, translated("Exporting"));
     VCardExport writer(database, out, options.version == "3" ? VCardVersion::v3 : VCardVersion::v4,
                        [&](size_t done, size_t total) {
                            if (total > 1000) bar.update(static_cast<double>(done) / static_cast<double>(total));
@@ -147,7 +147,7 @@ void exportCards(Context& context, const ExportOptions& options) {
         cards = exportTo(context, options, file.stream());
         file.finish();
     }
-    context.say(fmt::format("{} cards written.", cards));
+    context.say(tr("{} written.", countedText(cards, "card", "cards")));
 }
 
 // list, search and show
@@ -242,11 +242,10 @@ void search(Context& context, const std::vector<std::string>& words, bool full) 
     std::string text;
     for (const std::string& word : words) text += (text.empty() ? "" : " ") + word;
     const CXSearchQuery query(text);
-    if (query.empty()) throw CommandError(kUsage, "Name a word to search for.");
+    if (query.empty()) throw CommandError(kUsage, translated("Name a word to search for."));
     const std::vector<CXListing> people = context.database().peopleFound(query);
     if (people.empty() && !context.json)
-        throw CommandError(kNotFound,
-                           fmt::format("Nobody has \"{}\" in name, organisation, mail, phone or note.", text));
+        throw CommandError(kNotFound, tr("Nobody has \"{}\" in name, organisation, mail, phone or note.", text));
     tell(context, people, full);
     if (people.empty()) context.exitCode = kNotFound;
 }
@@ -265,12 +264,13 @@ void show(Context& context, const std::vector<std::string>& names) {
 
 // add, edit, delete ------------------------------------------------------------------------------------------------
 
+// `done` has a place for the name.
 void tell(Context& context, CXPerson& person, const std::string& done) {
     if (context.json)
         context.print({{"identifier", person.uniqueId().str()}, {"name", person.displayName()}});
     else
         context.line(person.uniqueId().str());
-    context.say(fmt::format("{} {}.", person.displayName(), done));
+    context.say(done);
 }
 
 void add(Context& context, const PersonFields& fields, const std::vector<std::string>& groups) {
@@ -280,11 +280,12 @@ void add(Context& context, const PersonFields& fields, const std::vector<std::st
     const CXPersonRef person = CXPerson::create();
     fields.applyTo(*person);
     if (person->cxUsedProperties().empty())
-        throw CommandError(kUsage, "A contact needs at least one of the options that `rolvane add --help` lists.");
+        throw CommandError(kUsage,
+                           translated("A contact needs at least one of the options that `rolvane add --help` lists."));
     database.addRecord(person);
     for (const CXGroupRef& group : joined) group->addMember(person);
     database.save();
-    tell(context, *person, "added");
+    tell(context, *person, tr("{} added.", person->displayName()));
 }
 
 void edit(Context& context, const std::string& name, const PersonFields& fields) {
@@ -296,7 +297,8 @@ void edit(Context& context, const std::string& name, const PersonFields& fields)
     }
     const bool changed = context.database().hasUnsavedChanges();
     context.database().save();
-    tell(context, *person, changed ? "changed" : "stays as it was");
+    tell(context, *person,
+         changed ? tr("{} changed.", person->displayName()) : tr("{} stays as it was.", person->displayName()));
 }
 
 // "Delete 1 person (Ada Miller)? 2 users who read your contacts lose it, too."
@@ -308,16 +310,16 @@ std::string deletionOf(CXRolvane& database, const std::vector<CXPersonRef>& peop
             publishers.insert(publisherOf(person->remoteLocation()));
         else
             own.insert(person->uniqueId());
-    std::string question = fmt::format("Delete {}{}?", counted(people.size(), "person", "people"),
-                                       people.size() == 1 ? fmt::format(" ({})", people[0]->displayName()) : "");
+    std::string question = tr("Delete {}{}?", countedText(people.size(), "person", "people"),
+                              people.size() == 1 ? fmt::format(" ({})", people[0]->displayName()) : "");
     for (const std::string& publisher : publishers)
-        question += fmt::format(" {} loses what you delete of theirs, too.", publisher);
+        question += tr(" {} loses what you delete of theirs, too.", publisher);
     const Shown shown = shownToReaders(database);
     const bool seen =
         std::any_of(own.begin(), own.end(), [&](const UniqueId& uid) { return shown.people.contains(uid); });
     if (const size_t readers = Shares(database).readers().size(); seen && readers > 0)
-        question += fmt::format(" {} your contacts {} it, too.", counted(readers, "user who reads", "users who read"),
-                                readers == 1 ? "loses" : "lose");
+        question += readers == 1 ? translated(" 1 user who reads your contacts loses it, too.")
+                                 : tr(" {} users who read your contacts lose it, too.", shownNumber(readers));
     return question;
 }
 
@@ -330,7 +332,7 @@ void remove(Context& context, const std::vector<std::string>& names, bool yes, b
         const auto same = [&](const CXPersonRef& other) { return other->uniqueId() == person->uniqueId(); };
         if (std::none_of(people.begin(), people.end(), same)) people.push_back(person);
     }
-    requireConsent(context, yes, deletionOf(database, people), "Nothing was deleted.");
+    requireConsent(context, yes, deletionOf(database, people), translated("Nothing was deleted."));
     std::vector<UniqueId> deleted;
     for (const CXPersonRef& person : people) {
         deleted.push_back(person->uniqueId());
@@ -339,8 +341,8 @@ void remove(Context& context, const std::vector<std::string>& names, bool yes, b
     database.save();
     if (purge)
         for (const UniqueId& uid : deleted) CXHistory(database).forget(uid);
-    context.say(counted(people.size(), "person", "people") + " deleted." +
-                (purge ? "" : " `rolvane undo` brings back."));
+    context.say(tr("{} deleted.", countedText(people.size(), "person", "people")) +
+                (purge ? "" : translated(" `rolvane undo` brings back.")));
 }
 
 } // namespace

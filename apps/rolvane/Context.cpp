@@ -64,6 +64,10 @@ void Context::line(const std::string& text) {
     std::cout << shownText(text) << "\n";
 }
 
+void Context::row(const std::string& label, const std::string& text, size_t column) {
+    line(label + std::string(column - std::min(column - 1, columnsOf(label)), ' ') + text);
+}
+
 void Context::say(const std::string& text) {
     if (!quiet) std::cerr << shownText(text) << "\n";
 }
@@ -116,6 +120,17 @@ std::string pathOf(const CLI::App& command) {
 
 } // namespace
 
+void translateOptions(CLI::App& command) {
+    for (CLI::Option* option : command.get_options()) {
+        option->description(translated(option->get_description().c_str()));
+        if (option->get_group() == "Options") option->group(translated("Options"));
+    }
+    for (CLI::App* group : command.get_subcommands([](const CLI::App* each) { return each->get_name().empty(); })) {
+        group->description(translated(group->get_description().c_str()));
+        translateOptions(*group);
+    }
+}
+
 CLI::App* addCommand(CLI::App& parent, Context& context, const std::string& name, const std::string& description,
                      const std::function<void(CLI::App&)>& declare, std::function<void()> body) {
     CLI::App* command = parent.add_subcommand(name, translated(description.c_str()));
@@ -124,6 +139,8 @@ CLI::App* addCommand(CLI::App& parent, Context& context, const std::string& name
     command->add_flag("--json", context.json, "Print data as one JSON document");
     command->add_flag("-q,--quiet", context.quiet, "No messages but errors");
     if (declare) declare(*command);
+    command->group(translated("Subcommands"));
+    translateOptions(*command);
     if (body)
         command->final_callback([&context, path = pathOf(*command), body = std::move(body)] {
             Preferences::shared().keepElsewhere(daemonMemory()); // makes its directory, which --help does not need

@@ -54,9 +54,11 @@ public:
 
     void print(const nlohmann::ordered_json& data); // one JSON document and a line end
     void line(const std::string& text);             // a line of data
-    void say(const std::string& text);              // a line of talk, unless --quiet
-    void warn(const std::string& text);             // a line on standard error, always
-    bool talkIsTerminal() const;                    // standard error is a terminal
+    // A line of data with its label in a column of its own.
+    void row(const std::string& label, const std::string& text, size_t column = 15);
+    void say(const std::string& text);  // a line of talk, unless --quiet
+    void warn(const std::string& text); // a line on standard error, always
+    bool talkIsTerminal() const;        // standard error is a terminal
     bool dataIsTerminal() const;
     size_t dataColumns() const; // of the terminal that standard output is; 0 for any other
 
@@ -79,6 +81,9 @@ private:
     int _shown = -1;
     bool _open = false;
 };
+
+// Puts what the help says of a command's options into the person's language.
+void translateOptions(CLI::App& command);
 
 // Adds a command whose body runs after the whole line has been parsed. The body throws or sets context.exitCode.
 CLI::App* addCommand(CLI::App& parent, Context& context, const std::string& name, const std::string& description,

@@ -2,7 +2,6 @@
 #include "Computers.h"
 #include "Conflicts.h"
 #include "Context.h"
-#include "Counted.h"
 #include "FailureText.h"
 #include "LeftOnStore.h"
 #include "PassReport.h"
@@ -160,18 +159,19 @@ Json endedJson(const Preferences& preferences, bool publishes) {
 std::string endedText(const Json& ended) {
     std::string users;
     for (const Json& user : ended["mayStillRead"]) users += (users.empty() ? "" : ", ") + user.get<std::string>();
-    return tr("on {}: {}. `rolvane publish` publishes again.{}", shownDate(ended["date"].get<std::string>()),
-              ended["why"] == "withdrawnElsewhere"
-                  ? "another computer of yours has taken it off the store, or has published it anew; `rolvane join` "
-                    "keeps this one in step with a new one"
-              : ended["why"] == "replaced"
-                  ? translated("another publication of yours lies in its place on the store, made from another "
-                               "computer perhaps")
-                  : translated("the store has nothing of it any more, or does not let you in"),
-              users.empty() ? ""
-                            : tr(" The store does not know yet that you took rights away from {}: after `rolvane "
-                                 "publish`, `rolvane unshare` takes them away there.",
-                                 users));
+    return tr(
+        "on {}: {}. `rolvane publish` publishes again.{}", shownDate(ended["date"].get<std::string>()),
+        ended["why"] == "withdrawnElsewhere"
+            ? translated("another computer of yours has taken it off the store, or has published it anew; `rolvane "
+                         "join` keeps this one in step with a new one")
+        : ended["why"] == "replaced"
+            ? translated("another publication of yours lies in its place on the store, made from another "
+                         "computer perhaps")
+            : translated("the store has nothing of it any more, or does not let you in"),
+        users.empty() ? ""
+                      : tr(" The store does not know yet that you took rights away from {}: after `rolvane "
+                           "publish`, `rolvane unshare` takes them away there.",
+                           users));
 }
 
 Json status(Context& context) {
@@ -249,19 +249,18 @@ std::string inStepText(const Json& tree) {
 }
 
 std::string computerRow(const Json& computer) {
-    return computer["name"].get<std::string>() + (computer["thisComputer"].get<bool>() ? " (this one)" : "") +
-           (computer["lastThere"].is_null() ? ""
-                                            : ", last there " + shownDate(computer["lastThere"].get<std::string>()));
+    return computer["name"].get<std::string>() +
+           (computer["thisComputer"].get<bool>() ? translated(" (this one)") : "") +
+           (computer["lastThere"].is_null()
+                ? ""
+                : tr(", last there {}", shownDate(computer["lastThere"].get<std::string>())));
 }
 
 void showStatus(Context& context) {
     const Json s = status(context);
     if (!s["damaged"].is_null()) context.exitCode = kFailed;
     if (context.json) return context.print(s);
-    const auto row = [&](const std::string& label, const std::string& text) {
-        constexpr size_t kColumn = 15;
-        context.line(label + std::string(kColumn - std::min(kColumn - 1, columnsOf(label)), ' ') + text);
-    };
+    const auto row = [&](const std::string& label, const std::string& text) { context.row(label, text); };
     const size_t people = s["people"], groups = s["groups"], pending = s["pending"];
     row(translated("Contacts"),
         countedText(people, "person", "people") + ", " + countedText(groups, "group", "groups"));
@@ -269,7 +268,7 @@ void showStatus(Context& context) {
     row(translated("Daemon"), s["daemon"].is_null() ? translated("not running (`rolvane daemon start`)")
                                                     : tr("running, process {}", s["daemon"].get<int>()));
     if (s["store"].is_null()) {
-        row(translated("Store"), translated("no account yet (`rolvane account set`)"));
+        row(translated("Store"), translated("no account yet (`rolvane setup`)"));
     } else {
         const Json& store = s["store"];
         row(translated("Store"),
@@ -279,7 +278,7 @@ void showStatus(Context& context) {
     }
     row(translated("Published"), publishedText(s["published"]));
     if (s["computers"].size() > 1) {
-        std::string label = "Computers";
+        std::string label = translated("Computers");
         for (const Json& computer : s["computers"]) row(std::exchange(label, ""), computerRow(computer));
     }
     if (!s["publicationEnded"].is_null()) row("", tr("ended {}", endedText(s["publicationEnded"])));
@@ -366,7 +365,7 @@ void watch(Context& context, const WatchOptions& options) {
             }
             context.line(data.dump());
         } else if (event.kind == Kind::progress && draw) {
-            if (!bar) bar = std::make_unique<ProgressBar>(context, "Synchronising");
+            if (!bar) bar = std::make_unique<ProgressBar>(context, translated("Synchronising"));
             bar->update(event.fraction, event.location);
         } else {
             bar.reset();
@@ -401,8 +400,8 @@ void watch(Context& context, const WatchOptions& options) {
     if (!inTime && options.once)
         throw CommandError(kUnreachable, tr("No pass ended within {} seconds.{}", options.seconds,
                                             runs ? ""
-                                                 : " RolvaneManager is not running; `rolvane daemon "
-                                                   "start` starts it."));
+                                                 : translated(" RolvaneManager is not running; `rolvane daemon "
+                                                              "start` starts it.")));
 }
 
 } // namespace

@@ -1,5 +1,6 @@
 #include "Consent.h"
 #include "Context.h"
+#include "Texts.h"
 
 #include "contacts/database/DamagedDatabase.h"
 #include "daemon/DaemonControl.h"
@@ -18,13 +19,14 @@ void addDatabaseCommands(CLI::App& app, Context& context) {
         [&context, yes] {
             requireNoDatabase({});
             requireConsent(context, *yes,
-                           "Begin with 0 contacts? The former database is lost but for a backup, which `rolvane "
-                           "restore` brings back.",
-                           "No database was made.");
+                           translated("Begin with 0 contacts? The former database is lost but for a backup, which "
+                                      "`rolvane restore` brings back."),
+                           translated("No database was made."));
             DaemonControl().stop();
             beginNewDatabase({});
-            context.say("A new contact database was made. Import contacts with `rolvane import`, and publish and "
-                        "subscribe anew.");
+            context.say(
+                translated("A new contact database was made. Import contacts with `rolvane import`, and publish and "
+                           "subscribe anew."));
         });
 }
 

@@ -1,7 +1,6 @@
 #include "Doctor.h"
 
 #include "AccountTrial.h"
-#include "Counted.h"
 #include "FailureText.h"
 #include "Publication.h"
 #include "PublishedAlready.h"
@@ -61,7 +60,12 @@ void Doctor::attempt(const std::string& check, const std::string& command, const
     try {
         add(look());
     } catch (const CXException& error) {
-        add({check, State::failed, error.reason(), command, Json::object()});
+        // Damaged preferences are one failure, whoever else needs them.
+        const bool isElsewhere = error.name() == kCXPreferencesException && check != "preferences";
+        if (isElsewhere)
+            add({check, State::unknown, translated("The preferences cannot be read."), "", Json::object()});
+        else
+            add({check, State::failed, error.reason(), command, Json::object()});
     }
 }
 
@@ -76,7 +80,8 @@ std::vector<Finding> Doctor::examine() {
 
 void Doctor::examineFiles() {
     attempt("database", "rolvane status", [this] { return database(); });
-    attempt("preferences", "rolvane defaults read", [this] { return preferences(); });
+    const std::string file = stateDirectory() + "/preferences.db";
+    attempt("preferences", fmt::format("mv '{0}' '{0}.damaged'", file), [this] { return preferences(); });
     attempt("disk", "df -h ~", [this] { return disk(); });
     attempt("account", "rolvane setup", [this] { return account(); });
 }
@@ -85,7 +90,11 @@ Finding Doctor::database() {
     const std::string path = dataDirectory() + "/contacts.db";
     if (access(path.c_str(), F_OK) != 0) {
         requireKnownDatabase(path, Preferences::shared());
-        return {"database", State::note, "There are no contacts yet.", "rolvane import FILE", {{"exists", false}}};
+        return {"database",
+                State::note,
+                translated("There are no contacts yet."),
+                "rolvane import FILE",
+                {{"exists", false}}};
     }
     CXRolvane& database = _context.database();
     const size_t people = database.countPeople(RemoteLocation("")),
@@ -100,7 +109,7 @@ Finding Doctor::database() {
     if (!damage.empty()) return {"database", State::failed, damage, "rolvane status", figures};
     return {"database",
             State::well,
-            counted(people, "person", "people") + ", " + counted(groups, "group", "groups") + ".",
+            countedText(people, "person", "people") + ", " + countedText(groups, "group", "groups") + ".",
             {},
             figures};
 }
@@ -109,7 +118,7 @@ Finding Doctor::preferences() {
     const size_t domains = Preferences::shared().domains().size();
     for (const std::string& key : Preferences::shared().keys(kDaemonDomain))
         (void)Preferences::shared().get(kDaemonDomain, key);
-    return {"preferences", State::well, "They can be read.", {}, {{"domains", domains}}};
+    return {"preferences", State::well, translated("They can be read."), {}, {{"domains", domains}}};
 }
 
 Finding Doctor::disk() {
@@ -128,10 +137,11 @@ Finding Doctor::disk() {
     const uint64_t megabytes = least >> 20;
     const Json figures{{"freeMegabytes", megabytes}, {"writable", !isReadOnly}};
     if (isReadOnly)
-        return {"disk", State::failed, "Your directories of rolvane cannot be written.",
+        return {"disk", State::failed, translated("Your directories of rolvane cannot be written."),
                 "ls -ld ~/.local/share/rolvane ~/.local/state/rolvane ~/.config/rolvane", figures};
-    const std::string room = fmt::format("{} MB are free where {} lies.", megabytes, where);
-    if (least < kNoRoom) return {"disk", State::failed, room + " That is too little.", "df -h " + where, figures};
+    const std::string room = tr("{} MB are free where {} lies.", megabytes, where);
+    if (least < kNoRoom)
+        return {"disk", State::failed, room + translated(" That is too little."), "df -h " + where, figures};
     return {"disk", least < kLittleRoom ? State::note : State::well, room, {}, figures};
 }
 
@@ -140,12 +150,12 @@ Finding Doctor::account() {
     if (!_account)
         return {"account",
                 State::note,
-                "There is no account on a store, so nothing is shared.",
+                translated("There is no account on a store, so nothing is shared."),
                 "rolvane setup",
                 {{"exists", false}}};
     Finding found{"account",
                   State::well,
-                  fmt::format("{} at {}.", _account->user.str(), _account->endpoint),
+                  tr("{} at {}.", _account->user.str(), _account->endpoint),
                   {},
                   {{"exists", true}, {"privateAuthority", !_account->caFile.empty()}}};
     try {
@@ -171,14 +181,14 @@ void Doctor::examineStore() {
         const bool isLogin = text.code == kRefused;
         add({"address",
              isLogin ? State::well : State::failed,
-             isLogin ? "The store answers." : text.what,
+             isLogin ? translated("The store answers.") : text.what,
              isLogin ? "" : "rolvane account test",
              {{"status", failure->status}, {"error", failure->error}}});
-        add({"login", isLogin ? State::failed : State::unknown, isLogin ? text.what : "It was not tried.",
+        add({"login", isLogin ? State::failed : State::unknown, isLogin ? text.what : translated("It was not tried."),
              isLogin ? "rolvane account set --ask-password" : "", Json::object()});
     } else {
-        add({"address", State::well, "The store answers at " + scene.store + ".", {}, Json::object()});
-        add({"login", State::well, "The store lets " + scene.self + " in.", {}, Json::object()});
+        add({"address", State::well, tr("The store answers at {}.", scene.store), {}, Json::object()});
+        add({"login", State::well, tr("The store lets {} in.", scene.self), {}, Json::object()});
     }
     attempt("authority", "rolvane account test", [this] { return authority(); });
     if (!_storeAnswers) return;
@@ -201,13 +211,18 @@ Finding Doctor::authority() {
     const auto first = *std::min_element(counted.begin(), counted.end(), sooner);
     const double left = first.until.secondsSince(now());
     const Json figures{{"certificates", chain.size()}, {"daysLeft", wholeDays(left)}};
-    const std::string whose = first.isAuthority ? "The store's authority" : "The store's certificate";
-    if (left < 0)
-        return {"authority", State::failed, fmt::format("{} ended on {}.", whose, shownDate(first.until)),
-                "rolvane store stop && rolvane store start", figures};
+    const std::string whose =
+        first.isAuthority ? translated("The store's authority") : translated("The store's certificate");
+    if (left < 0) {
+        const bool isHere = _account->origins().back().find("://localhost") != std::string::npos;
+        const std::string what = tr("{} ended on {}.", whose, shownDate(first.until));
+        return {"authority", State::failed,
+                isHere ? what : what + translated(" Whoever runs the store has to renew it; then try again."),
+                isHere ? "rolvane store stop && rolvane store start" : "rolvane account test", figures};
+    }
     return {"authority",
             left < kSoonDays * kDay ? State::note : State::well,
-            fmt::format("{} is good until {}.", whose, shownDate(first.until)),
+            tr("{} is good until {}.", whose, shownDate(first.until)),
             {},
             figures};
 }
@@ -220,14 +235,14 @@ Finding Doctor::clock() {
     const HttpResponse answer = store.transport().perform(std::move(request));
     const std::string* header = answer.header("date");
     const auto date = header ? Date::fromHTTP(*header) : std::nullopt;
-    if (!date) return {"clock", State::unknown, "The store does not tell the time.", {}, Json::object()};
+    if (!date) return {"clock", State::unknown, translated("The store does not tell the time."), {}, Json::object()};
     const double apart = std::abs(date->secondsSince(now()));
     const Json figures{{"secondsApart", std::llround(apart)}};
     if (apart > kClockSeconds)
         return {"clock", State::failed,
-                fmt::format("This machine's clock and the store's are {} seconds apart.", std::llround(apart)),
+                tr("This machine's clock and the store's are {} seconds apart.", std::llround(apart)),
                 "timedatectl set-ntp true", figures};
-    return {"clock", State::well, "This machine's clock and the store's agree.", {}, figures};
+    return {"clock", State::well, translated("This machine's clock and the store's agree."), {}, figures};
 }
 
 // WebDAV, locks, access lists and the rights in the own tree.
@@ -240,17 +255,22 @@ void Doctor::trial() {
                        {"accessLists", trial.accessLists},
                        {"status", trial.hindrance ? Json(trial.hindrance->status) : Json()}};
     if (trial.hindrance)
-        add({"rights", State::failed, hinderedBy(*trial.hindrance, "Nothing can be published there.").reason(),
+        add({"rights", State::failed,
+             hinderedBy(*trial.hindrance, translated("Nothing can be published there.")).reason(),
              "rolvane account test", figures});
     else
-        add({"rights", State::well, "The store lets you make, write, change and delete in your tree.", {}, figures});
+        add({"rights",
+             State::well,
+             translated("The store lets you make, write, change and delete in your tree."),
+             {},
+             figures});
     std::string lacks;
     for (const std::string& line : consequences(trial)) lacks += (lacks.empty() ? "" : " ") + line;
     const State state = trial.hindrance ? State::unknown : lacks.empty() ? State::well : State::note;
     add({"webdav",
          state,
-         trial.hindrance ? "It was not tried to the end."
-         : lacks.empty() ? "The store keeps locks, versions and access lists."
+         trial.hindrance ? translated("It was not tried to the end.")
+         : lacks.empty() ? translated("The store keeps locks, versions and access lists.")
                          : lacks,
          {},
          Json::object()});
@@ -258,11 +278,13 @@ void Doctor::trial() {
 
 Finding Doctor::structure() {
     const bool publishes = _databaseOpens && Publication(_context.database()).anything();
-    if (!publishes) return {"structure", State::well, "Nothing is published from here.", {}, {{"publishes", false}}};
+    if (!publishes)
+        return {"structure", State::well, translated("Nothing is published from here."), {}, {{"publishes", false}}};
     const bool whole = CXDAVManager::defaultManager().sanityCheckPublishStructureCreate(false);
     const Json figures{{"publishes", true}, {"whole", whole}};
-    if (whole) return {"structure", State::well, "Your published tree is whole.", {}, figures};
-    return {"structure", State::failed, "Your published tree lacks something on the store.", "rolvane sync", figures};
+    if (whole) return {"structure", State::well, translated("Your published tree is whole."), {}, figures};
+    return {"structure", State::failed, translated("Your published tree lacks something on the store."), "rolvane sync",
+            figures};
 }
 
 Finding Doctor::otherComputers() {
@@ -291,8 +313,9 @@ Finding Doctor::bus() {
     return {"bus",
             connected ? State::well : State::note,
             connected
-                ? "The session bus answers."
-                : "There is no session bus. Commands reach the daemon by its socket; other programs hear nothing.",
+                ? translated("The session bus answers.")
+                : translated(
+                      "There is no session bus. Commands reach the daemon by its socket; other programs hear nothing."),
             {},
             {{"connected", connected}}};
 }
@@ -302,11 +325,14 @@ Finding Doctor::daemon() {
     (void)control.programPath();
     const auto process = control.running();
     const Json figures{{"running", process.has_value()}, {"shares", _sharesSomething}};
-    if (process)
-        return {"launcher", State::well, fmt::format("RolvaneManager runs, process {}.", *process), {}, figures};
+    if (process) return {"launcher", State::well, tr("RolvaneManager runs, process {}.", *process), {}, figures};
     if (!_sharesSomething)
-        return {"launcher", State::well, "RolvaneManager does not run, and there is nothing to share.", {}, figures};
-    return {"launcher", State::failed, "RolvaneManager does not run, so nothing is kept in step.",
+        return {"launcher",
+                State::well,
+                translated("RolvaneManager does not run, and there is nothing to share."),
+                {},
+                figures};
+    return {"launcher", State::failed, translated("RolvaneManager does not run, so nothing is kept in step."),
             "rolvane daemon start", figures};
 }
 
@@ -315,7 +341,8 @@ Finding Doctor::unit() {
     if (!state)
         return {"unit",
                 State::note,
-                "No service manager of yours answers; the daemon is started directly, and not with your session.",
+                translated(
+                    "No service manager of yours answers; the daemon is started directly, and not with your session."),
                 {},
                 {{"manager", false}}};
     const Json figures{{"manager", true},
@@ -327,36 +354,40 @@ Finding Doctor::unit() {
     if (!state->loaded)
         return {"unit",
                 State::note,
-                "The unit RolvaneManager.service is not installed; the daemon is started directly.",
+                translated("The unit RolvaneManager.service is not installed; the daemon is started directly."),
                 {},
                 figures};
     if (state->needsReload)
-        return {"unit", State::failed, "The unit RolvaneManager.service has changed since it was read.",
+        return {"unit", State::failed, translated("The unit RolvaneManager.service has changed since it was read."),
                 "systemctl --user daemon-reload", figures};
     if (state->forbidden)
         return {"unit", State::failed,
-                "The unit RolvaneManager.service cannot start: the kernel forbids user namespaces. The section "
-                "CONFINEMENT of its manual page has the lines that do without.",
+                translated("The unit RolvaneManager.service cannot start: the kernel forbids user namespaces. The "
+                           "section CONFINEMENT of its manual page has the lines that do without."),
                 "man RolvaneManager", figures};
     if (!state->confined)
         return {"unit", State::failed,
-                "The unit RolvaneManager.service does not confine the daemon: something overrides its settings.",
+                translated(
+                    "The unit RolvaneManager.service does not confine the daemon: something overrides its settings."),
                 "systemctl --user cat RolvaneManager.service", figures};
     if (!state->apart)
         return {"unit", State::note,
-                "The unit RolvaneManager.service confines the daemon in part, without a user namespace.",
+                translated("The unit RolvaneManager.service confines the daemon in part, without a user namespace."),
                 "man RolvaneManager", figures};
     if (!state->enabled)
-        return {"unit", State::note, "The daemon does not start with your session.",
+        return {"unit", State::note, translated("The daemon does not start with your session."),
                 "systemctl --user enable RolvaneManager.socket RolvaneManager.service", figures};
-    return {"unit", State::well, "The daemon starts with your session, confined.", {}, figures};
+    return {"unit", State::well, translated("The daemon starts with your session, confined."), {}, figures};
 }
 
 Finding Doctor::queue() {
     const auto outcome = lastOutcome(Preferences::shared());
     if (!outcome)
-        return {
-            "queue", _sharesSomething ? State::note : State::well, "No pass has been made yet.", {}, {{"passes", 0}}};
+        return {"queue",
+                _sharesSomething ? State::note : State::well,
+                translated("No pass has been made yet."),
+                {},
+                {{"passes", 0}}};
     int64_t waiting = 0;
     double oldest = 0;
     for (const PassTree& tree : outcome->trees)
@@ -368,9 +399,9 @@ Finding Doctor::queue() {
                        {"waiting", waiting},
                        {"oldestHours", std::llround(oldest / 3600)},
                        {"hoursSincePass", std::llround(now().secondsSince(outcome->ended) / 3600)}};
-    if (waiting == 0) return {"queue", State::well, "Nothing waits.", {}, figures};
-    const std::string what = fmt::format("{}, the oldest for {} hours.",
-                                         counted(waiting, "change waits", "changes wait"), std::llround(oldest / 3600));
+    if (waiting == 0) return {"queue", State::well, translated("Nothing waits."), {}, figures};
+    const std::string what = tr("{}, the oldest for {} hours.", countedText(waiting, "change waits", "changes wait"),
+                                std::llround(oldest / 3600));
     return {"queue", oldest > kDay ? State::failed : State::note, what, "rolvane sync", figures};
 }
 

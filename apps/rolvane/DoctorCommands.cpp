@@ -1,9 +1,11 @@
 #include "Doctor.h"
 #include "SetupCommands.h"
+#include "Texts.h"
 #include "ValueNames.h"
 
 #include "foundation/Paths.h"
 
+#include <array>
 #include <filesystem>
 #include <fmt/format.h>
 
@@ -14,15 +16,23 @@ namespace {
 std::string label(const Finding& finding) {
     std::string text = finding.check;
     text[0] = static_cast<char>(std::toupper(static_cast<unsigned char>(text[0])));
-    return text;
+    return translated(text.c_str());
 }
+
+// The checks, for the catalogs.
+[[maybe_unused]] constexpr std::array<const char*, 16> kLabels{
+    marked("Database"), marked("Preferences"), marked("Disk"),      marked("Account"),
+    marked("Address"),  marked("Login"),       marked("Authority"), marked("Clock"),
+    marked("Rights"),   marked("Webdav"),      marked("Structure"), marked("Computers"),
+    marked("Bus"),      marked("Launcher"),    marked("Unit"),      marked("Queue"),
+};
 
 void tell(Context& context, const std::vector<Finding>& findings) {
     if (context.json) return context.print(findingsJson(findings));
     for (const Finding& finding : findings) {
         const char* mark = finding.state == Finding::State::failed ? "!! " : "";
-        context.line(fmt::format("{:<15}{}{}", label(finding), mark, finding.what));
-        if (!finding.toDo.empty()) context.line(fmt::format("{:<15}`{}`", "", finding.toDo));
+        context.row(label(finding), mark + finding.what);
+        if (!finding.toDo.empty()) context.row("", "`" + finding.toDo + "`");
     }
 }
 
@@ -32,12 +42,12 @@ void doctor(Context& context, const std::string& bundle) {
     if (!bundle.empty()) {
         const std::string path = std::filesystem::absolute(bundle).string();
         writeFileDurably(path, bundleOf(findings, ROLVANE_VERSION).dump(2) + "\n", 0600);
-        context.say(fmt::format("{} holds states and figures, and no names, numbers, addresses or secrets.", path));
+        context.say(tr("{} holds states and figures, and no names, numbers, addresses or secrets.", path));
     }
     if (!allWell(findings))
         context.exitCode = kFailed;
     else
-        context.say("All is well.");
+        context.say(translated("All is well."));
 }
 
 } // namespace

@@ -1,7 +1,7 @@
 #include "Context.h"
-#include "Counted.h"
 #include "Lookup.h"
 #include "SafeText.h"
+#include "Texts.h"
 #include "ValueNames.h"
 
 #include "contacts/records/PersonJoining.h"
@@ -29,9 +29,9 @@ const char* wordFor(CXAlikeness alikeness) {
 
 const char* reasonFor(CXAlikeness alikeness) {
     switch (alikeness) {
-    case CXAlikeness::same: return "the same name, and an address or number in common";
-    case CXAlikeness::named: return "the same name, and nothing else in common";
-    case CXAlikeness::reached: return "different names, and an address or number in common";
+    case CXAlikeness::same: return translated("the same name, and an address or number in common");
+    case CXAlikeness::named: return translated("the same name, and nothing else in common");
+    case CXAlikeness::reached: return translated("different names, and an address or number in common");
     case CXAlikeness::none: break;
     }
     return "";
@@ -59,9 +59,9 @@ void listDuplicates(Context& context) {
     if (context.json)
         context.print(all);
     else if (found.empty())
-        context.say("Nobody looks like anybody else.");
+        context.say(translated("Nobody looks like anybody else."));
     else
-        context.say("`rolvane merge` makes one of several.");
+        context.say(translated("`rolvane merge` makes one of several."));
 }
 
 struct MergeOptions {
@@ -79,9 +79,9 @@ Several namedPeople(CXRolvane& database, const std::vector<std::string>& names) 
     const auto add = [&](const CXPersonRef& person) {
         if (!seen.insert(person->uniqueId()).second) return;
         if (person->isSubscribed())
-            throw CommandError(kRefused, fmt::format("{} is a copy of somebody else's contact. Only people of your own "
-                                                     "can be made one.",
-                                                     person->displayName()));
+            throw CommandError(kRefused, tr("{} is a copy of somebody else's contact. Only people of your own "
+                                            "can be made one.",
+                                            person->displayName()));
         people.push_back(person);
     };
     if (names.size() == 1) {
@@ -91,8 +91,9 @@ Several namedPeople(CXRolvane& database, const std::vector<std::string>& names) 
         for (const std::string& name : names) add(findPerson(database, name, true));
     }
     if (people.size() < 2)
-        throw CommandError(kNotFound, "There are no two people to make one of. `rolvane duplicates` lists who looks "
-                                      "alike; name them by their identifiers.");
+        throw CommandError(kNotFound,
+                           translated("There are no two people to make one of. `rolvane duplicates` lists who looks "
+                                      "alike; name them by their identifiers."));
     return people;
 }
 
@@ -108,7 +109,8 @@ std::vector<Several> alikePeople(CXRolvane& database) {
 
 void merge(Context& context, const MergeOptions& options) {
     if (options.alike != options.names.empty())
-        throw CommandError(kUsage, "Name people to make one of, or give --alike for all who surely are one.");
+        throw CommandError(kUsage,
+                           translated("Name people to make one of, or give --alike for all who surely are one."));
     CXRolvane& database = context.database();
     const std::vector<Several> all =
         options.alike ? alikePeople(database) : std::vector<Several>{namedPeople(database, options.names)};
@@ -123,11 +125,11 @@ void merge(Context& context, const MergeOptions& options) {
             joined.push_back(uid.str());
             const auto lost = joinPeople(database, first, people[i]);
             removed++;
-            context.say(fmt::format("{} ({}) becomes one with {} ({}).", shownLine(name), uid.str(),
-                                    shownLine(first->displayName()), first->uniqueId().str()));
+            context.say(tr("{} ({}) becomes one with {} ({}).", shownLine(name), uid.str(),
+                           shownLine(first->displayName()), first->uniqueId().str()));
             for (const std::string& each : lost) {
                 gaveWay.push_back(each);
-                context.say("  gave way, and stands in the note: " + shownLine(each));
+                context.say(translated("  gave way, and stands in the note: ") + shownLine(each));
             }
         }
         told.push_back({{"identifier", first->uniqueId().str()},
@@ -140,8 +142,8 @@ void merge(Context& context, const MergeOptions& options) {
     else
         database.save();
     if (context.json) context.print(told);
-    context.say(fmt::format("{} joined with others.{}", counted(removed, "person was", "people were"),
-                            options.dryRun ? " Nothing was changed: this was a trial." : ""));
+    context.say(tr("{} joined with others.{}", countedText(removed, "person was", "people were"),
+                   options.dryRun ? translated(" Nothing was changed: this was a trial.") : ""));
 }
 
 } // namespace

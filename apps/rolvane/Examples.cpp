@@ -1,5 +1,7 @@
 #include "Examples.h"
 
+#include "Texts.h"
+
 #include <map>
 
 namespace rolvane::cli {
@@ -134,8 +136,8 @@ std::string exampleOf(const std::string& path) {
 }
 
 std::string helpFooter(const std::string& path) {
-    const std::string lines = exampleOf(path), codes = "`rolvane --help` lists the exit codes.";
-    return lines.empty() ? codes : "Examples:\n" + lines + "\n\n" + codes;
+    const std::string lines = exampleOf(path), codes = translated("`rolvane --help` lists the exit codes.");
+    return lines.empty() ? codes : translated("Examples:") + ("\n" + lines) + "\n\n" + codes;
 }
 
 } // namespace rolvane::cli

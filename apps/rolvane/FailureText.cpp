@@ -134,7 +134,7 @@ FailureText failureText(const PassFailure& failure, const FailureScene& scene) {
 }
 
 CommandError noAccount() {
-    return {kNotFound, translated("There is no account on a store yet. `rolvane account set` makes one.")};
+    return {kNotFound, translated("There is no account on a store yet. `rolvane setup` makes one.")};
 }
 
 FailureScene sceneOfTheAccount(Date at) {

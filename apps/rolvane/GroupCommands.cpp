@@ -1,10 +1,10 @@
 #include "Consent.h"
 #include "Context.h"
-#include "Counted.h"
 #include "Lookup.h"
 #include "Publication.h"
 #include "RecordJson.h"
 #include "Subscriptions.h"
+#include "Texts.h"
 #include "ValueNames.h"
 
 #include "contacts/records/Constants.h"
@@ -34,8 +34,10 @@ void listGroups(Context& context, const Whose& whose) {
         if (context.json)
             all.push_back(toJson(*group));
         else
-            context.line(fmt::format("{}  {}  ({} members, {} groups){}", group->uniqueId().str(), group->name(),
-                                     group->memberCount(), group->subgroupUniqueIds().size(), ownerMark(listing)));
+            context.line(fmt::format("{}  {}  ({}, {}){}", group->uniqueId().str(), group->name(),
+                                     countedText(group->memberCount(), "member", "members"),
+                                     countedText(group->subgroupUniqueIds().size(), "group", "groups"),
+                                     ownerMark(listing)));
     }
     if (context.json) context.print(all);
 }
@@ -51,12 +53,13 @@ void showGroup(Context& context, const std::string& named) {
     CXRolvane& database = context.database();
     const CXGroupRef group = findGroup(database, named);
     if (context.json) return context.print(toJson(*group));
+    constexpr size_t kColumn = 18;
     context.line(group->name());
-    context.line(fmt::format("{:<18}{}", "Identifier", group->uniqueId().str()));
-    if (group->isSubscribed()) context.line(fmt::format("{:<18}{}", "From", fromText(*group)));
+    context.row(translated("Identifier"), group->uniqueId().str(), kColumn);
+    if (group->isSubscribed()) context.row(translated("From"), fromText(*group), kColumn);
     const auto choices = group->distributionChoices();
     for (const UniqueId& uid : group->subgroupUniqueIds())
-        context.line(fmt::format("{:<18}{}", "Group", nameOf(database, uid)));
+        context.row(translated("Group"), nameOf(database, uid), kColumn);
     for (const UniqueId& uid : group->memberUniqueIds()) {
         std::string line = nameOf(database, uid);
         const auto person = std::dynamic_pointer_cast<CXPerson>(database.recordForUniqueId(uid));
@@ -64,37 +67,40 @@ void showGroup(Context& context, const std::string& named) {
             for (const auto& [property, identifier] : chosen->second)
                 if (const auto values = person->multiValueForProperty(property))
                     line += fmt::format("  [{}: {}]", property, values->valueForIdentifier(identifier).description());
-        context.line(fmt::format("{:<18}{}", "Member", line));
+        context.row(translated("Member"), line, kColumn);
     }
 }
 
+// `done` names the group.
 void tell(Context& context, CXGroup& group, const std::string& done) {
     if (context.json) context.print({{"identifier", group.uniqueId().str()}, {"name", group.name()}});
-    context.say(fmt::format("\"{}\" {}.", group.name(), done));
+    context.say(done);
 }
 
 void createGroup(Context& context, const GroupOptions& options) {
     CXRolvane& database = context.database();
     for (const CXListing& other : database.listGroups(RemoteLocation("")))
         if (other.displayName == options.name)
-            throw CommandError(kRefused, fmt::format("There is a group \"{}\" already.", options.name));
+            throw CommandError(kRefused, tr("There is a group \"{}\" already.", options.name));
     std::vector<CXPersonRef> members;
     for (const std::string& name : options.names) members.push_back(findPerson(database, name));
     const CXGroupRef group = CXGroup::create();
-    if (!group->setValue(options.name, kCXGroupNameProperty)) throw CommandError(kUsage, "A group needs a name.");
+    if (!group->setValue(options.name, kCXGroupNameProperty))
+        throw CommandError(kUsage, translated("A group needs a name."));
     database.addRecord(group);
     for (const CXPersonRef& person : members) group->addMember(person);
     database.save();
     if (!context.json) context.line(group->uniqueId().str());
-    tell(context, *group, "made");
+    tell(context, *group, tr("\"{}\" made.", group->name()));
 }
 
 void renameGroup(Context& context, const GroupOptions& options) {
     const CXGroupRef group = findChangeableGroup(context.database(), options.group);
     const std::string former = group->name();
-    if (!group->setValue(options.name, kCXGroupNameProperty)) throw CommandError(kUsage, "A group needs a name.");
+    if (!group->setValue(options.name, kCXGroupNameProperty))
+        throw CommandError(kUsage, translated("A group needs a name."));
     context.database().save();
-    tell(context, *group, fmt::format("is the new name of \"{}\"", former));
+    tell(context, *group, tr("\"{}\" is the new name of \"{}\".", group->name(), former));
 }
 
 void deleteGroup(Context& context, const GroupOptions& options) {
@@ -102,16 +108,16 @@ void deleteGroup(Context& context, const GroupOptions& options) {
     const std::string name = group->name();
     const Publication publication(context.database());
     if (!publication.everything() && publication.publishes(group))
-        throw CommandError(kRefused, fmt::format("\"{}\" is published by itself. Withdraw it first, with `rolvane "
-                                                 "unpublish --group`: its files would stay on the store.",
-                                                 name));
+        throw CommandError(kRefused, tr("\"{}\" is published by itself. Withdraw it first, with `rolvane "
+                                        "unpublish --group`: its files would stay on the store.",
+                                        name));
     requireConsent(context, options.yes,
-                   fmt::format("Delete the group \"{}\" with {}? The members stay.", name,
-                               counted(group->memberCount(), "member", "members")),
-                   "Nothing was deleted.");
+                   tr("Delete the group \"{}\" with {}? The members stay.", name,
+                      countedText(group->memberCount(), "member", "members")),
+                   translated("Nothing was deleted."));
     context.database().removeRecord(group);
     context.database().save();
-    context.say(fmt::format("The group \"{}\" is deleted; its members stay.", name));
+    context.say(tr("The group \"{}\" is deleted; its members stay.", name));
 }
 
 // Adds or removes members, all or none.
@@ -124,8 +130,8 @@ void changeMembers(Context& context, const GroupOptions& options, bool adding) {
     for (const CXPersonRef& person : people) changed += adding ? group->addMember(person) : group->removeMember(person);
     database.save();
     tell(context, *group,
-         fmt::format("{} {} member{}", adding ? "has" : "lost",
-                     adding ? fmt::format("{} new", changed) : std::to_string(changed), changed == 1 ? "" : "s"));
+         adding ? tr("\"{}\" has {}.", group->name(), countedText(changed, "new member", "new members"))
+                : tr("\"{}\" lost {}.", group->name(), countedText(changed, "member", "members")));
 }
 
 void changeSubgroups(Context& context, const GroupOptions& options, bool adding) {
@@ -136,7 +142,9 @@ void changeSubgroups(Context& context, const GroupOptions& options, bool adding)
     for (const CXGroupRef& subgroup : subgroups)
         adding ? group->addSubgroup(subgroup) : group->removeSubgroup(subgroup);
     database.save();
-    tell(context, *group, adding ? "has the group in it" : "no longer has the group in it");
+    tell(context, *group,
+         adding ? tr("\"{}\" has the group in it.", group->name())
+                : tr("\"{}\" no longer has the group in it.", group->name()));
 }
 
 // The value that is meant: by identifier, by text, by label.
@@ -150,8 +158,8 @@ std::string valueIdentifier(const CXPerson& person, const std::string& property,
     if (values)
         for (const CXMultiValue::Entry& entry : values->entries())
             known += fmt::format("\n  {}  {}  {}", entry.identifier, entry.label, entry.value.description());
-    throw CommandError(kNotFound, fmt::format("{} has no {} \"{}\".{}", person.displayName(), property, named,
-                                              known.empty() ? "" : " There are:" + known));
+    throw CommandError(kNotFound, tr("{} has no {} \"{}\".{}", person.displayName(), property, named,
+                                     known.empty() ? "" : translated(" There are:") + known));
 }
 
 void choose(Context& context, const GroupOptions& options) {
@@ -160,16 +168,17 @@ void choose(Context& context, const GroupOptions& options) {
     const CXPersonRef person = findPerson(database, options.person);
     const auto members = group->memberUniqueIds();
     if (std::find(members.begin(), members.end(), person->uniqueId()) == members.end())
-        throw CommandError(kNotFound, fmt::format("{} is no member of \"{}\".", person->displayName(), group->name()));
+        throw CommandError(kNotFound, tr("{} is no member of \"{}\".", person->displayName(), group->name()));
     if (options.clear == !options.value.empty())
-        throw CommandError(kUsage, "Name the value that the group is to use, or give --clear.");
+        throw CommandError(kUsage, translated("Name the value that the group is to use, or give --clear."));
     std::optional<std::string> identifier;
     if (!options.clear) identifier = valueIdentifier(*person, options.property, options.value);
     group->setDistributionIdentifier(identifier, options.property, person);
     database.save();
     tell(context, *group,
-         options.clear ? fmt::format("has no choice of {} for {} any more", options.property, person->displayName())
-                       : fmt::format("uses {} for {}", options.value, person->displayName()));
+         options.clear
+             ? tr("\"{}\" has no choice of {} for {} any more.", group->name(), options.property, person->displayName())
+             : tr("\"{}\" uses {} for {}.", group->name(), options.value, person->displayName()));
 }
 
 } // namespace

@@ -1,6 +1,6 @@
 #include "ImportReport.h"
 
-#include "Counted.h"
+#include "Texts.h"
 
 #include <fmt/format.h>
 #include <fmt/ranges.h>
@@ -42,15 +42,19 @@ Json importReport(const VCardImportReport& report, bool dryRun) {
 
 void tellAll(Context& context, const std::vector<VCardError>& all, size_t count, const char* one, const char* more) {
     for (const VCardError& each : all) context.warn(each.description());
-    if (count > all.size()) context.warn("and " + counted(count - all.size(), one, more));
+    if (count > all.size()) context.warn(tr("and {}", countedText(count - all.size(), one, more)));
 }
 
 void tellForeignText(Context& context, const VCardForeignText& foreign) {
-    const std::string what = foreign.lines == 0 ? "the text" : counted(foreign.lines, "line", "lines");
-    const std::string advice = foreign.detected ? " That is a guess; --charset names another one." : "";
-    const bool one = foreign.lines <= 1;
-    context.say(fmt::format("{}: {} {} not UTF-8 and {} read as {}.{}", foreign.file, what, one ? "is" : "are",
-                            one ? "was" : "were", foreign.charset, advice));
+    const std::string advice =
+        foreign.detected ? translated(" That is a guess; --charset names another one.") : std::string();
+    if (foreign.lines == 0)
+        context.say(tr("{}: the text is not UTF-8 and was read as {}.{}", foreign.file, foreign.charset, advice));
+    else if (foreign.lines == 1)
+        context.say(tr("{}: 1 line is not UTF-8 and was read as {}.{}", foreign.file, foreign.charset, advice));
+    else
+        context.say(tr("{}: {} lines are not UTF-8 and were read as {}.{}", foreign.file, shownNumber(foreign.lines),
+                       foreign.charset, advice));
 }
 
 } // namespace
@@ -60,18 +64,19 @@ void reportImport(Context& context, const VCardImportReport& report, size_t unre
     tellAll(context, report.notices, report.noticeCount, "more of the kind", "more of the kind");
     for (const VCardForeignText& foreign : report.foreign) tellForeignText(context, foreign);
     for (const VCardNoteColumns& each : report.intoTheNote)
-        context.say(fmt::format("{}: people have no place for {}; what stands there is kept in the note.", each.file,
-                                fmt::join(each.columns, ", ")));
+        context.say(tr("{}: people have no place for {}; what stands there is kept in the note.", each.file,
+                       fmt::join(each.columns, ", ")));
     if (report.missingMembers > 0)
-        context.say(counted(report.missingMembers, "member of a group has", "members of groups have") +
-                    " no card here. They are kept by their identifiers, and join when their cards come.");
+        context.say(tr("{} no card here. They are kept by their identifiers, and join when their cards come.",
+                       countedText(report.missingMembers, "member of a group has", "members of groups have")));
     if (context.json)
         context.print(importReport(report, dryRun));
     else
-        context.say(fmt::format("{} imported, {} updated, {} unchanged, {}, {} left out.", report.imported,
-                                report.updated, report.unchanged, counted(report.groups, "group", "groups"),
-                                counted(report.errorCount, "bad card", "bad cards")));
-    if (dryRun) context.say("Nothing was changed: this was a trial.");
+        context.say(tr("{} imported, {} updated, {} unchanged, {}, {} left out.", shownNumber(report.imported),
+                       shownNumber(report.updated), shownNumber(report.unchanged),
+                       countedText(report.groups, "group", "groups"),
+                       countedText(report.errorCount, "bad card", "bad cards")));
+    if (dryRun) context.say(translated("Nothing was changed: this was a trial."));
     if (report.errorCount + unreadable + report.linesLost > 0)
         context.exitCode = report.imported + report.updated + report.unchanged + report.groups > 0 ? kPartly : kFailed;
 }

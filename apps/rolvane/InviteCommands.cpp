@@ -4,6 +4,7 @@
 #include "QrCode.h"
 #include "SetupCommands.h"
 #include "Terminal.h"
+#include "Texts.h"
 
 #include "foundation/Paths.h"
 #include "store/account/Account.h"
@@ -29,16 +30,16 @@ std::string authorityFingerprint(const CXDAVAccount& account) {
     const auto believed = certificatesIn(readFile(account.caFile));
     for (const ShownCertificate& shown : certificatesShownAt(Url(account.origins().back() + "/")))
         if (withFingerprint(believed, shown.fingerprint)) return shown.fingerprint;
-    throw CommandError(kFailed, fmt::format("The store at {} does not show the certificate of its authority, so no "
-                                            "invitation can name it. Have the server send its whole chain, or give the "
-                                            "other person the file {}.",
-                                            account.origins().back(), account.caFile));
+    throw CommandError(kFailed, tr("The store at {} does not show the certificate of its authority, so no "
+                                   "invitation can name it. Have the server send its whole chain, or give the "
+                                   "other person the file {}.",
+                                   account.origins().back(), account.caFile));
 }
 
 void invite(Context& context, const InviteOptions& options) {
     const auto account = CXDAVAccount::load();
     if (!account) throw noAccount();
-    requireStore(context, "Nobody was invited.");
+    requireStore(context, translated("Nobody was invited."));
     Invitation invitation;
     invitation.endpoint = account->secureEndpoint.empty() ? account->endpoint : account->secureEndpoint;
     invitation.user = options.user;
@@ -48,9 +49,9 @@ void invite(Context& context, const InviteOptions& options) {
     theirs.user = UserName(options.user);
     theirs.endpoint = invitation.endpoint;
     if (const auto problem = theirs.problem()) throw CommandError(kUsage, *problem);
-    if (options.askPassword) invitation.password = readSecret("First password of " + options.user + ": ");
+    if (options.askPassword) invitation.password = readSecret(tr("First password of {}: ", options.user));
     if (options.askPassword && invitation.password.empty())
-        throw CommandError(kUsage, "The password is empty. Nobody was invited.");
+        throw CommandError(kUsage, translated("The password is empty. Nobody was invited."));
     printInvitation(context, invitation, options.qr);
 }
 
@@ -75,17 +76,16 @@ void printInvitation(Context& context, const Invitation& invitation, bool qr) {
                               {"fingerprint", invitation.fingerprint},
                               {"invitation", line}});
     context.line(line);
-    if (qr) std::cout << qrCode(line, context.dataIsTerminal());
-    context.say(
-        fmt::format("`rolvane setup 'LINE'` with this line, typed by {}, sets everything up.", invitation.user));
+    if (qr) showQrCode(context, line);
+    context.say(tr("`rolvane setup 'LINE'` with this line, typed by {}, sets everything up.", invitation.user));
     if (invitation.password.empty())
-        context.say("It holds no password: setup asks for it.");
+        context.say(translated("It holds no password: setup asks for it."));
     else if (invitation.passwordPath.empty())
-        context.say("Whoever reads it can sign in: send it so that nobody else does.");
+        context.say(translated("Whoever reads it can sign in: send it so that nobody else does."));
     else
         context.say(
-            "Whoever uses it first has the account, and then the line is of no more use: send it so that nobody "
-            "else reads it.");
+            translated("Whoever uses it first has the account, and then the line is of no more use: send it so that "
+                       "nobody else reads it."));
 }
 
 void addInviteCommands(CLI::App& app, Context& context) {

@@ -1,6 +1,7 @@
 #include "LeftOnStore.h"
 
 #include "Publication.h"
+#include "Texts.h"
 
 #include "conduits/PublishedLayout.h"
 #include "contacts/records/Identifier.h"
@@ -24,7 +25,7 @@ constexpr int kMissing = 404;
 } // namespace
 
 std::string LeftOnStore::Failure::answer() const {
-    return code == 0 ? "it did not answer" : fmt::format("it answered {}", code);
+    return code == 0 ? translated("it did not answer") : tr("it answered {}", code);
 }
 
 LeftOnStore::LeftOnStore(CXRolvane& database, Preferences& preferences, const Url& base)
@@ -109,7 +110,7 @@ std::optional<LeftOnStore::Failure> LeftOnStore::remove() {
 std::optional<LeftOnStore::Failure> LeftOnStore::removeTree() {
     int code = 0;
     if (CXDAVManager::defaultManager().removeFileAtURL(_base, &code)) return std::nullopt;
-    return Failure{fmt::format("the files at {}", _base.absoluteString()), code};
+    return Failure{tr("the files at {}", _base.absoluteString()), code};
 }
 
 // Its mention in the list of groups, its state and directory, and the people of nobody else's interest.
@@ -117,7 +118,7 @@ std::optional<LeftOnStore::Failure> LeftOnStore::removeGroup(const UniqueId& gro
     CXDAVManager& store = CXDAVManager::defaultManager();
     int code = 0;
     const Url all = layout::groupLocation(_base, UniqueId(layout::kAllGroup));
-    const char* const list = "the group's entry in the list of groups";
+    const char* const list = translated("the group's entry in the list of groups");
     if (const auto state = store.dictionaryAtURL(all, true, &code)) {
         Dictionary changed = state->mutableCopy();
         Array subgroups = changed["subgroupUIDState"].array().mutableCopy();
@@ -127,14 +128,15 @@ std::optional<LeftOnStore::Failure> LeftOnStore::removeGroup(const UniqueId& gro
     } else if (code != kMissing) {
         return Failure{list, code};
     }
-    if (!store.removeFileAtURL(layout::groupLocation(_base, group), &code)) return Failure{"the group", code};
+    if (!store.removeFileAtURL(layout::groupLocation(_base, group), &code))
+        return Failure{translated("the group"), code};
     std::set<UniqueId> wanted;
     for (const CXGroupRef& published : Publication(_database).groups())
         for (const UniqueId& member : published->memberIdentifiers()) wanted.insert(member);
     for (const Value& entry : people) {
         const UniqueId person(entry.string());
         if (!wanted.contains(person) && !store.removeFileAtURL(layout::contactLocation(_base, person), &code))
-            return Failure{"a contact of the group", code};
+            return Failure{translated("a contact of the group"), code};
     }
     return std::nullopt;
 }

@@ -1,8 +1,8 @@
 #include "LogCommands.h"
 
 #include "Consent.h"
-#include "Counted.h"
 #include "Lookup.h"
+#include "RecordJson.h"
 #include "SafeText.h"
 #include "Shares.h"
 #include "Subscriptions.h"
@@ -15,6 +15,7 @@
 
 #include <algorithm>
 #include <fmt/format.h>
+#include <functional>
 #include <set>
 
 namespace rolvane::cli {
@@ -51,9 +52,9 @@ UniqueId findInHistory(CXRolvane& database, const std::string& named) {
 // The author of the change: this computer's program, a device, or somebody on the store.
 std::string byWhom(CXRolvane& database, const CXLoggedChange& change, const std::vector<CXChangeDetail>& details) {
     if (change.program == kHere)
-        return change.command.empty() ? "here" : fmt::format("here, `rolvane {}`", change.command);
-    if (change.program == kBooks) return "an address book's client";
-    if (change.program != kDaemon) return "here, " + change.program;
+        return change.command.empty() ? translated("here") : tr("here, `rolvane {}`", change.command);
+    if (change.program == kBooks) return translated("an address book's client");
+    if (change.program != kDaemon) return tr("here, {}", change.program);
     std::set<std::string> publishers;
     bool own = false;
     for (const CXChangeDetail& detail : details) {
@@ -67,23 +68,23 @@ std::string byWhom(CXRolvane& database, const CXLoggedChange& change, const std:
         else
             properties = CXHistory(database).after(detail);
         const std::string publisher = publisherOf(RemoteLocation(locationOf(RecordKind::subscribedPerson, properties)));
-        publishers.insert(publisher.empty() ? "a publisher" : publisher);
+        publishers.insert(publisher.empty() ? translated("a publisher") : publisher);
         if (publishers.size() > 1) break;
     }
     std::string text;
     if (own) {
         const std::vector<std::string> writers = Shares(database).writers();
-        text = writers.size() == 1 ? writers.front() : "a subscriber who may write";
+        text = writers.size() == 1 ? writers.front() : translated("a subscriber who may write");
     }
     for (const std::string& publisher : publishers) text += (text.empty() ? "" : ", ") + publisher;
-    return text.empty() ? "the daemon" : text;
+    return text.empty() ? translated("the daemon") : text;
 }
 
 std::string amountOf(const CXLoggedChange& change) {
     std::string text;
-    if (change.people > 0) text = counted(change.people, "person", "people");
-    if (change.groups > 0) text += (text.empty() ? "" : ", ") + counted(change.groups, "group", "groups");
-    return text.empty() ? "memberships" : text;
+    if (change.people > 0) text = countedText(change.people, "person", "people");
+    if (change.groups > 0) text += (text.empty() ? "" : ", ") + countedText(change.groups, "group", "groups");
+    return text.empty() ? translated("memberships") : text;
 }
 
 const char* verb(CXDetailKind kind) {
@@ -98,20 +99,27 @@ const char* verb(CXDetailKind kind) {
     return "";
 }
 
-// A value for people: the values of a list with their labels.
-std::string valueText(const Value& value) {
-    if (!value) return "nothing";
+// A value as text: the values of a list with their labels.
+std::string valueText(const Value& value, const std::function<std::string(const Value&)>& single) {
     const auto several = CXMultiValue::fromValue(value);
-    if (!several) return value.description();
+    if (!several) return single(value);
     std::string text;
     for (const CXMultiValue::Entry& entry : several->entries())
-        text += (text.empty() ? "" : ", ") + entry.label + ": " + entry.value.description();
+        text += (text.empty() ? "" : ", ") + entry.label + ": " + single(entry.value);
+    return text;
+}
+
+// For programs, the same everywhere.
+Json valueJson(const Value& value) {
+    if (!value) return nullptr;
+    const std::string text = valueText(value, [](const Value& single) { return single.description(); });
     return text.empty() ? "nothing" : text;
 }
 
 std::string cutValue(const Value& value) {
     constexpr size_t kColumns = 60;
-    return cutTo(shownLine(valueText(value)), kColumns);
+    const std::string text = value ? valueText(value, oneLine) : "";
+    return text.empty() ? translated("nothing") : cutTo(shownLine(text), kColumns);
 }
 
 struct Difference {
@@ -144,9 +152,8 @@ Json detailJson(CXRolvane& database, CXHistory& history, const CXChangeDetail& d
     if (detail.kind == CXDetailKind::changed) {
         Json properties = Json::array();
         for (const Difference& each : differencesOf(history, detail))
-            properties.push_back({{"property", each.property},
-                                  {"before", each.before ? Json(valueText(each.before)) : Json()},
-                                  {"after", each.after ? Json(valueText(each.after)) : Json()}});
+            properties.push_back(
+                {{"property", each.property}, {"before", valueJson(each.before)}, {"after", valueJson(each.after)}});
         data["properties"] = properties;
     }
     return data;
@@ -157,24 +164,27 @@ void tellDetail(Context& context, CXHistory& history, const CXChangeDetail& deta
     if (!detail.group.empty()) {
         const std::string group = shownLine(nameOf(context.database(), detail.group));
         return context.line(detail.kind == CXDetailKind::chosen
-                                ? fmt::format("      {}: another value is used in {}", name, group)
-                                : fmt::format("      {} {} {}", name, verb(detail.kind), group));
+                                ? tr("      {}: another value is used in {}", name, group)
+                            : detail.kind == CXDetailKind::joined ? tr("      {} joined {}", name, group)
+                                                                  : tr("      {} left {}", name, group));
     }
-    context.line(fmt::format("      {} {}", name, verb(detail.kind)));
+    context.line(detail.kind == CXDetailKind::added     ? tr("      {} added", name)
+                 : detail.kind == CXDetailKind::changed ? tr("      {} changed", name)
+                                                        : tr("      {} deleted", name));
     for (const Difference& each : differencesOf(history, detail))
-        context.line(
-            fmt::format("        {}: {} -> {}", shownLine(each.property), cutValue(each.before), cutValue(each.after)));
+        context.line(fmt::format("        {}: {} -> {}", shownLine(translated(each.property.c_str())),
+                                 cutValue(each.before), cutValue(each.after)));
 }
 
 void forgetContact(Context& context, const UniqueId& uid, const LogOptions& options) {
     CXHistory history(context.database());
     const size_t changes = history.latest(SIZE_MAX >> 1, uid).size();
     requireConsent(context, options.yes,
-                   fmt::format("Forget what is kept of {} in {}? Nothing of it can be taken back then.",
-                               options.contact, counted(changes, "change", "changes")),
-                   "Nothing was forgotten.");
+                   tr("Forget what is kept of {} in {}? Nothing of it can be taken back then.", options.contact,
+                      countedText(changes, "change", "changes")),
+                   translated("Nothing was forgotten."));
     history.forget(uid);
-    context.say(fmt::format("The log knows nothing of {} any more.", options.contact));
+    context.say(tr("The log knows nothing of {} any more.", options.contact));
 }
 
 void showLog(Context& context, const LogOptions& options) {
@@ -182,7 +192,7 @@ void showLog(Context& context, const LogOptions& options) {
     CXHistory history(database);
     std::optional<UniqueId> of;
     if (!options.contact.empty()) of = findInHistory(database, options.contact);
-    if (options.purge && !of) throw CommandError(kUsage, "Name the contact that is to be forgotten.");
+    if (options.purge && !of) throw CommandError(kUsage, translated("Name the contact that is to be forgotten."));
     if (options.purge) return forgetContact(context, *of, options);
     Json all = Json::array();
     for (const CXLoggedChange& change : history.latest(options.limit, of)) {
@@ -200,7 +210,7 @@ void showLog(Context& context, const LogOptions& options) {
             continue;
         }
         context.line(fmt::format("{:>4}  {}  {}  {}{}", change.number, shownDate(change.date), amountOf(change),
-                                 shownLine(who), change.isUndone ? "  (taken back)" : ""));
+                                 shownLine(who), change.isUndone ? translated("  (taken back)") : ""));
         if (of)
             for (const CXChangeDetail& detail : details) tellDetail(context, history, detail);
         else if (details.size() == 1)
@@ -208,30 +218,31 @@ void showLog(Context& context, const LogOptions& options) {
     }
     if (context.json) return context.print(all);
     if (history.latest(1, of).empty())
-        context.say("No change is known. Changes are kept for 30 days.");
+        context.say(translated("No change is known. Changes are kept for 30 days."));
     else
-        context.say("`rolvane undo NUMBER` takes a change back.");
+        context.say(translated("`rolvane undo NUMBER` takes a change back."));
 }
 
 // The latest change that was made here and not taken back.
 CXLoggedChange latestHere(CXHistory& history) {
     for (const CXLoggedChange& change : history.latest(1000))
         if (change.program == kHere && !change.isUndone && change.command != kUndo) return change;
-    throw CommandError(kNotFound, "There is no change of yours to take back. `rolvane log` lists all changes; name one "
-                                  "by its number.");
+    throw CommandError(kNotFound,
+                       translated("There is no change of yours to take back. `rolvane log` lists all changes; name one "
+                                  "by its number."));
 }
 
 CXLoggedChange changeToUndo(CXHistory& history, int64_t number) {
     if (number == 0) return latestHere(history);
     const auto change = history.change(number);
     if (!change)
-        throw CommandError(kNotFound, fmt::format("There is no change {}. `rolvane log` lists those of the last 30 "
-                                                  "days.",
-                                                  number));
+        throw CommandError(kNotFound, tr("There is no change {}. `rolvane log` lists those of the last 30 "
+                                         "days.",
+                                         number));
     if (change->isUndone)
-        throw CommandError(kRefused, fmt::format("Change {} was taken back already. `rolvane log` has the change that "
-                                                 "did it; take that one back to have this one again.",
-                                                 number));
+        throw CommandError(kRefused, tr("Change {} was taken back already. `rolvane log` has the change that "
+                                        "did it; take that one back to have this one again.",
+                                        number));
     return *change;
 }
 
@@ -257,16 +268,17 @@ void undo(Context& context, int64_t number, bool dryRun) {
                        {"dryRun", dryRun}});
     std::string what;
     const auto add = [&](size_t count, const std::string& text) {
-        if (count > 0) what += fmt::format("{}{} {}", what.empty() ? "" : ", ", count, text);
+        if (count > 0) what += (what.empty() ? "" : ", ") + text;
     };
-    add(undone.broughtBack, undone.asOwn == 0 ? "brought back" : "brought back as your own");
-    add(undone.removed, "removed");
-    add(undone.changed, "changed back");
+    add(undone.broughtBack, undone.asOwn == 0 ? tr("{} brought back", shownNumber(undone.broughtBack))
+                                              : tr("{} brought back as your own", shownNumber(undone.broughtBack)));
+    add(undone.removed, tr("{} removed", shownNumber(undone.removed)));
+    add(undone.changed, tr("{} changed back", shownNumber(undone.changed)));
     add(undone.memberships,
-        undone.memberships == 1 ? "membership or choice restored" : "memberships or choices restored");
-    context.say(fmt::format("Change {} of {}: {}.{}", change.number, shownDate(change.date),
-                            what.empty() ? "nothing of it is left to take back" : what,
-                            dryRun ? " Nothing was changed: this was a trial." : ""));
+        countedText(undone.memberships, "membership or choice restored", "memberships or choices restored"));
+    context.say(tr("Change {} of {}: {}.{}", change.number, shownDate(change.date),
+                   what.empty() ? translated("nothing of it is left to take back") : what,
+                   dryRun ? translated(" Nothing was changed: this was a trial.") : ""));
     if (!undone.left.empty()) context.exitCode = undone.anything() ? kPartly : kFailed;
 }
 

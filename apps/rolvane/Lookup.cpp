@@ -6,6 +6,8 @@
 #include "Suggestions.h"
 #include "Texts.h"
 
+#include "store/dav/CXDAVManager.h"
+
 #include <algorithm>
 #include <fmt/format.h>
 #include <functional>
@@ -101,7 +103,16 @@ CXGroupRef findGroup(CXRolvane& database, const std::string& named, bool whole) 
 }
 
 void requireWritable(const CXRecord& record) {
-    if (const std::string reason = record.readOnlyReason(); !reason.empty()) throw CommandError(kRefused, reason);
+    const auto* person = dynamic_cast<const CXPerson*>(&record);
+    const auto* group = dynamic_cast<const CXGroup*>(&record);
+    const std::string name = person ? person->displayName() : group ? group->name() : record.uniqueId().str();
+    const std::string reason = record.readOnlyReason();
+    if (reason.empty()) return;
+    const std::string publisher = publisherOf(record.remoteLocation());
+    if (publisher.empty()) throw CommandError(kRefused, reason);
+    throw CommandError(kRefused, tr("\"{}\" is a copy of {}'s, which may be read but not changed. Ask {} for `rolvane "
+                                    "share {} --write`.",
+                                    name, publisher, publisher, CXDAVManager::vaultraUser()));
 }
 
 CXGroupRef findChangeableGroup(CXRolvane& database, const std::string& named, bool whole) {

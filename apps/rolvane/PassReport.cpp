@@ -1,6 +1,5 @@
 #include "PassReport.h"
 
-#include "Counted.h"
 #include "FailureText.h"
 #include "Texts.h"
 

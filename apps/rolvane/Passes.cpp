@@ -93,7 +93,7 @@ PassOutcome makePass(Context& context, double seconds) {
     PassWatch watch(context, !context.quiet);
     OutcomeWatch outcomes(context);
     if (!daemon.running()) return outcomeOfOnce(watch, outcomes, seconds);
-    ProgressBar bar(context, "Synchronising");
+    ProgressBar bar(context, translated("Synchronising"));
     watch.onEvent = [&](const PassWatch::Event& event) {
         if (event.kind == PassWatch::Event::Kind::progress) bar.update(event.fraction);
     };

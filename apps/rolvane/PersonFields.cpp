@@ -1,6 +1,7 @@
 #include "PersonFields.h"
 
 #include "Context.h"
+#include "Texts.h"
 #include "ValueNames.h"
 
 #include "contacts/records/Constants.h"
@@ -46,8 +47,8 @@ Value addressFrom(const std::string& text) {
         ++part;
     }
     if (address.empty())
-        throw CommandError(
-            kUsage, fmt::format("\"{}\" is no address. Write \"label:Street; ZIP; City; State; Country\".", text));
+        throw CommandError(kUsage,
+                           tr("\"{}\" is no address. Write \"label:Street; ZIP; City; State; Country\".", text));
     return address;
 }
 
@@ -58,7 +59,7 @@ void removeValues(CXMutableMultiValue& values, const std::vector<std::string>& u
             return e.identifier == text || e.label == text || e.value.string() == text;
         });
         if (found == entries.end())
-            throw CommandError(kNotFound, fmt::format("There is no {} \"{}\" to remove.", property, text));
+            throw CommandError(kNotFound, tr("There is no {} \"{}\" to remove.", property, text));
         values.removeAtIndex(static_cast<size_t>(found - entries.begin()));
     }
 }
@@ -81,8 +82,8 @@ void changeMulti(std::vector<Change>& changes, const CXPerson& person, const cha
 }
 
 Value birthdayFrom(const std::string& text) {
-    const auto date = Date::fromISO8601(text + "T12:00:00Z");
-    if (!date) throw CommandError(kUsage, fmt::format("\"{}\" is no date. Write it as 1980-12-31.", text));
+    const auto date = Date::fromISO8601(text + "T00:00:00Z");
+    if (!date) throw CommandError(kUsage, tr("\"{}\" is no date. Write it as 1980-12-31.", text));
     return *date;
 }
 
@@ -98,17 +99,17 @@ const char* imageType(const std::string& bytes) {
 
 const std::vector<PersonFields::Single>& PersonFields::singles() {
     static const std::vector<Single> all{
-        {"--first", kCXFirstNameProperty, "First name"},
-        {"--middle", kCXMiddleNameProperty, "Middle name"},
-        {"--last", kCXLastNameProperty, "Last name"},
-        {"--prefix", kCXTitleProperty, "Title before the name"},
-        {"--suffix", kCXSuffixProperty, "Suffix behind the name"},
-        {"--nickname", kCXNicknameProperty, "Nickname"},
-        {"--org", kCXOrganizationProperty, "Organisation"},
-        {"--department", kCXDepartmentProperty, "Department"},
-        {"--title", kCXJobTitleProperty, "Job title"},
-        {"--note", kCXNoteProperty, "Note"},
-        {"--home-page", kCXHomePageProperty, "Home page"},
+        {"--first", kCXFirstNameProperty, translated("First name")},
+        {"--middle", kCXMiddleNameProperty, translated("Middle name")},
+        {"--last", kCXLastNameProperty, translated("Last name")},
+        {"--prefix", kCXTitleProperty, translated("Title before the name")},
+        {"--suffix", kCXSuffixProperty, translated("Suffix behind the name")},
+        {"--nickname", kCXNicknameProperty, translated("Nickname")},
+        {"--org", kCXOrganizationProperty, translated("Organisation")},
+        {"--department", kCXDepartmentProperty, translated("Department")},
+        {"--title", kCXJobTitleProperty, translated("Job title")},
+        {"--note", kCXNoteProperty, translated("Note")},
+        {"--home-page", kCXHomePageProperty, translated("Home page")},
     };
     return all;
 }
@@ -144,7 +145,7 @@ void PersonFields::applyTo(CXPerson& person) const {
     if (!photo.empty()) {
         const std::string bytes = readFile(photo, kMaxPhotoBytes);
         const char* type = imageType(bytes);
-        if (!type) throw CommandError(kUsage, fmt::format("{} is no PNG, JPEG, GIF or WebP picture.", photo));
+        if (!type) throw CommandError(kUsage, tr("{} is no PNG, JPEG, GIF or WebP picture.", photo));
         changes.push_back({kCXPhotoProperty, Bytes(bytes.begin(), bytes.end())});
         changes.push_back({kCXPhotoTypeProperty, type});
     }
@@ -154,7 +155,7 @@ void PersonFields::applyTo(CXPerson& person) const {
     changeMulti(changes, person, kCXAddressProperty, addresses, removedAddresses, true);
     for (const std::string& property : unset) {
         if (person.valueForProperty(property).isAbsent())
-            throw CommandError(kNotFound, fmt::format("{} has no property {}.", person.displayName(), property));
+            throw CommandError(kNotFound, tr("{} has no property {}.", person.displayName(), property));
         changes.push_back({property, Value()});
     }
     for (const Change& change : changes) // what stays as it was is no edit, which would travel to everybody

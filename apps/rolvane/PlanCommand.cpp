@@ -1,12 +1,12 @@
 #include "PlanCommand.h"
 
-#include "Counted.h"
 #include "Publication.h"
 #include "RecordJson.h"
 #include "SafeText.h"
 #include "Shares.h"
 #include "Shown.h"
 #include "Subscriptions.h"
+#include "Texts.h"
 
 #include "contacts/records/Identifier.h"
 #include "daemon/DaemonControl.h"
@@ -62,14 +62,26 @@ Unseen unseenByTheDaemon(CXRolvane& database) {
 
 std::string changesText(const Json& changes) {
     std::string text;
-    for (const char* kind : {"added", "changed", "deleted"})
-        if (const size_t count = changes[kind]; count > 0)
-            text += fmt::format("{}{} {}", text.empty() ? "" : ", ", count, kind);
-    return text.empty() ? "no new edit" : text;
+    const auto add = [&](const char* kind, const std::string& words) {
+        if (changes[kind] > 0) text += (text.empty() ? "" : ", ") + words;
+    };
+    add("added", tr("{} added", shownNumber(changes["added"])));
+    add("changed", tr("{} changed", shownNumber(changes["changed"])));
+    add("deleted", tr("{} deleted", shownNumber(changes["deleted"])));
+    return text.empty() ? translated("no new edit") : text;
 }
 
 std::string waitingText(size_t waiting) {
-    return waiting == 0 ? "" : fmt::format("; {} for the store", counted(waiting, "change waits", "changes wait"));
+    return waiting == 0 ? "" : tr("; {} for the store", countedText(waiting, "change waits", "changes wait"));
+}
+
+// "Yours: 318 people and 6 groups are readable for 2 users (bob and carol), changeable for 1 user (bob)."
+std::string readableText(const Shown& shown, const std::vector<std::string>& readers,
+                         const std::vector<std::string>& writers) {
+    const std::string who = readers.empty() ? translated("nobody") : usersText(readers);
+    const std::string more = writers.empty() ? "" : tr(", changeable for {}", usersText(writers));
+    return shown.isOne() ? tr("Yours: {} is readable for {}{}.", shown.amount(), who, more)
+                         : tr("Yours: {} are readable for {}{}.", shown.amount(), who, more);
 }
 
 void plan(Context& context) {
@@ -103,25 +115,25 @@ void plan(Context& context) {
             {{"own", own}, {"subscriptions", others}, {"copies", unseen.json(true)}, {"daemonHasRun", daemonHasRun}});
 
     if (!publishes)
-        context.line("Yours: nothing is published, so nothing leaves this computer.");
+        context.line(translated("Yours: nothing is published, so nothing leaves this computer."));
     else
-        context.line(fmt::format("Yours: {} {} readable for {}{}.", shown.amount(), shown.isOne() ? "is" : "are",
-                                 readers.empty() ? "nobody" : usersText(readers),
-                                 writers.empty() ? "" : ", changeable for " + usersText(writers)));
+        context.line(readableText(shown, readers, writers));
     if (publishes && !daemonHasRun)
-        context.line("       All of it goes to the store: the daemon has not run yet.");
+        context.line(translated("       All of it goes to the store: the daemon has not run yet."));
     else if (publishes)
-        context.line(fmt::format("       {} since the daemon looked last{}.", changesText(own["unseen"]),
-                                 waitingText(ownWaiting)));
+        context.line(
+            tr("       {} since the daemon looked last{}.", changesText(own["unseen"]), waitingText(ownWaiting)));
     for (const Json& s : others) {
         const size_t unsent = s["unsent"];
-        context.line(fmt::format("{}: {}; {}.", shownLine(s["user"].get<std::string>()),
-                                 s["writable"].get<bool>() ? "news comes, and your edits go there" : "news comes",
-                                 unsent == 0 ? "nothing waits to be sent"
-                                             : counted(unsent, "change waits", "changes wait") + " to be sent"));
+        context.line(fmt::format(
+            "{}: {}; {}.", shownLine(s["user"].get<std::string>()),
+            s["writable"].get<bool>() ? translated("news comes, and your edits go there") : translated("news comes"),
+            unsent == 0 ? translated("nothing waits to be sent")
+                        : tr("{} to be sent", countedText(unsent, "change waits", "changes wait"))));
     }
-    context.say("`rolvane sync` carries it at once. --dry-run tells the same of publish, share, unpublish, subscribe, "
-                "import and merge.");
+    context.say(translated(
+        "`rolvane sync` carries it at once. --dry-run tells the same of publish, share, unpublish, subscribe, "
+        "import and merge."));
 }
 
 } // namespace

@@ -1,5 +1,6 @@
 #include "Context.h"
 #include "RecordJson.h"
+#include "Texts.h"
 #include "ValueNames.h"
 
 #include "foundation/Preferences.h"
@@ -20,7 +21,7 @@ void read(Context& context, const DefaultsOptions& options) {
     if (!options.key.empty()) {
         const Value value = preferences.get(options.domain, options.key);
         if (value.isAbsent())
-            throw CommandError(kNotFound, fmt::format("There is no {} in the domain {}.", options.key, options.domain));
+            throw CommandError(kNotFound, tr("There is no {} in the domain {}.", options.key, options.domain));
         return context.json ? context.print(toJson(value)) : context.line(value.description());
     }
     Dictionary all;
@@ -30,9 +31,7 @@ void read(Context& context, const DefaultsOptions& options) {
 
 Value parsed(const DefaultsOptions& options) {
     const std::string& text = options.value;
-    const auto wrong = [&] {
-        return CommandError(kUsage, fmt::format("\"{}\" is not of the type {}.", text, options.type));
-    };
+    const auto wrong = [&] { return CommandError(kUsage, tr("\"{}\" is not of the type {}.", text, options.type)); };
     if (options.type == "string") return text;
     if (options.type == "plist") return PropertyList::fromXML(text);
     if (options.type == "bool") {
@@ -58,16 +57,16 @@ void write(Context& context, const DefaultsOptions& options) {
     Preferences& preferences = Preferences::shared();
     preferences.set(options.domain, options.key, parsed(options));
     preferences.synchronize(options.domain);
-    context.say(fmt::format("{} is set.", options.key));
+    context.say(tr("{} is set.", options.key));
 }
 
 void remove(Context& context, const DefaultsOptions& options) {
     Preferences& preferences = Preferences::shared();
     if (preferences.get(options.domain, options.key).isAbsent())
-        throw CommandError(kNotFound, fmt::format("There is no {} in the domain {}.", options.key, options.domain));
+        throw CommandError(kNotFound, tr("There is no {} in the domain {}.", options.key, options.domain));
     preferences.remove(options.domain, options.key);
     preferences.synchronize(options.domain);
-    context.say(fmt::format("{} is removed.", options.key));
+    context.say(tr("{} is removed.", options.key));
 }
 
 } // namespace

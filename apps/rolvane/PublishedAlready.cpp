@@ -31,6 +31,15 @@ std::string knownSerial(const Preferences& preferences) {
     return {};
 }
 
+// The list of everybody has no entry, or is not there at all.
+bool namesNobody(CXDAVManager& store, const Url& base) {
+    int code = 0;
+    const auto list = store.dictionaryAtURL(layout::groupLocation(base, UniqueId(layout::kAllGroup)), true, &code);
+    constexpr int kMissing = 404;
+    if (!list) return code == kMissing;
+    return (*list)["memberUIDState"].array().empty() && (*list)["subgroupUIDState"].array().empty();
+}
+
 const char* name(PublishedAlready::By by) {
     switch (by) {
     case PublishedAlready::By::nobody: return "nobody";
@@ -52,24 +61,26 @@ PublishedAlready publishedAlready(CXDAVManager& store, const Preferences& prefer
     const auto info = store.dictionaryAtURL(base.cxURLByAppendingComponent(layout::kInfo), true, nullptr);
     if (!info) return {};
     const std::string serial = (*info)[kSerialNumber].string();
+    const auto computers = ComputersOnStore(store, base).read().value_or(std::vector<Computer>());
+    // A reader's own tree may be there with nothing in it.
+    if (!publishesHere && computers.empty() && namesNobody(store, base)) return {};
     const std::string known = knownSerial(preferences);
     const bool isOurs = known.empty() ? publishesHere && lastOutcome(preferences) : serial == known;
     return {isOurs ? PublishedAlready::By::thisComputer : PublishedAlready::By::another,
-            store.modDateForURL(base.cxURLByAppendingComponent(layout::kDateFile)),
-            ComputersOnStore(store, base).read().value_or(std::vector<Computer>())};
+            store.modDateForURL(base.cxURLByAppendingComponent(layout::kDateFile)), computers};
 }
 
 std::string publishedAlreadyText(const PublishedAlready& found) {
-    const std::string when = found.lastWrite ? fmt::format("; last written {}", shownDate(*found.lastWrite)) : "";
+    const std::string when = found.lastWrite ? tr("; last written {}", shownDate(*found.lastWrite)) : "";
     switch (found.by) {
-    case PublishedAlready::By::nobody: return "Nothing of this account is published yet.";
+    case PublishedAlready::By::nobody: return translated("Nothing of this account is published yet.");
     case PublishedAlready::By::thisComputer:
-        return fmt::format("Contacts of this account are published, from this computer{}.", when);
+        return tr("Contacts of this account are published, from this computer{}.", when);
     case PublishedAlready::By::another: break;
     }
-    return fmt::format("Contacts of this account are published already, from another computer or another database{}{}. "
-                       "`rolvane join` brings them here and keeps both in step.",
-                       found.computers.empty() ? "" : ": " + computersText(found.computers), when);
+    return tr("Contacts of this account are published already, from another computer or another database{}{}. "
+              "`rolvane join` brings them here and keeps both in step.",
+              found.computers.empty() ? "" : ": " + computersText(found.computers), when);
 }
 
 nlohmann::ordered_json publishedAlreadyJson(const PublishedAlready& found) {

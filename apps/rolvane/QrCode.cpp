@@ -1,7 +1,11 @@
 #include "QrCode.h"
 
 #include "Context.h"
+#include "SafeText.h"
+#include "Texts.h"
 
+#include <cstdlib>
+#include <iostream>
 #include <memory>
 #include <qrencode.h>
 
@@ -11,7 +15,7 @@ std::string qrCode(const std::string& text, bool coloured) {
     constexpr int kQuiet = 4; // modules
     const std::unique_ptr<QRcode, decltype(&QRcode_free)> code(QRcode_encodeString8bit(text.c_str(), 0, QR_ECLEVEL_M),
                                                                &QRcode_free);
-    if (!code) throw CommandError(kFailed, "The text is too long for a QR code.");
+    if (!code) throw CommandError(kFailed, translated("The text is too long for a QR code."));
     const int width = code->width;
     const auto isLight = [&](int x, int y) {
         const bool outside = x < 0 || y < 0 || x >= width || y >= width;
@@ -28,6 +32,17 @@ std::string qrCode(const std::string& text, bool coloured) {
         out += "\n";
     }
     return out;
+}
+
+void showQrCode(Context& context, const std::string& text) {
+    const char* noColour = std::getenv("NO_COLOR");
+    const std::string code = qrCode(text, context.dataIsTerminal() && !(noColour && *noColour));
+    std::cout << code;
+    const std::string row = qrCode(text, false);
+    const size_t width = columnsOf(row.substr(0, row.find('\n'))), columns = context.dataColumns();
+    if (columns > 0 && columns < width)
+        context.warn(tr("The QR code is {} columns wide, and this terminal has {}: make it wider, and ask again.",
+                        width, columns));
 }
 
 } // namespace rolvane::cli

@@ -37,11 +37,13 @@ std::string Questions::text(const std::string& question, const std::string& fall
 
 bool Questions::yes(const std::string& question, bool fallback) {
     while (_mayAsk) {
-        std::string given = answer(fmt::format("{} [{}] ", question, fallback ? "Y/n" : "y/N"));
+        std::string given = answer(fmt::format("{} [{}] ", question, fallback ? translated("Y/n") : translated("y/N")));
         std::transform(given.begin(), given.end(), given.begin(), [](unsigned char c) { return std::tolower(c); });
         if (given.empty()) return fallback;
-        if (given == "y" || given == "yes") return true;
-        if (given == "n" || given == "no") return false;
+        for (const std::string word : {"yes", translated("yes")})
+            if (word.starts_with(given)) return true;
+        for (const std::string word : {"no", translated("no")})
+            if (word.starts_with(given)) return false;
         _context.warn(translated("Answer y or n."));
     }
     return fallback;

@@ -2,6 +2,7 @@
 
 #include "SafeText.h"
 #include "Subscriptions.h"
+#include "Texts.h"
 
 #include "contacts/records/Constants.h"
 #include "contacts/vcard/VCardFields.h"
@@ -62,8 +63,8 @@ Json ownerJson(const RemoteLocation& location) {
 }
 
 std::string fromText(const CXRecord& record) {
-    return fmt::format("{}, at {} ({})", publisherOf(record.remoteLocation()), record.remoteLocation().str(),
-                       record.isWritable() ? "may be changed" : "read only");
+    return tr("{}, at {} ({})", publisherOf(record.remoteLocation()), record.remoteLocation().str(),
+              record.isWritable() ? translated("may be changed") : translated("read only"));
 }
 
 Json toJson(CXPerson& person) {
@@ -160,36 +161,45 @@ Json toJson(CXGroup& group) {
 namespace {
 
 constexpr std::array<std::pair<const char*, const char*>, 14> kSingles{{
-    {kCXTitleProperty, "Title"},
-    {kCXNicknameProperty, "Nickname"},
-    {kCXMaidenNameProperty, "Maiden name"},
-    {kCXFirstNamePhoneticProperty, "First, phonetic"},
-    {kCXLastNamePhoneticProperty, "Last, phonetic"},
-    {kCXOrganizationProperty, "Organisation"},
-    {kCXDepartmentProperty, "Department"},
-    {kCXJobTitleProperty, "Job title"},
-    {kCXBirthdayProperty, "Birthday"},
-    {kCXBirthdayTextProperty, "Birthday"},
-    {kCXHomePageProperty, "Home page"},
-    {kCXCategoriesProperty, "Categories"},
-    {kCXPhotoProperty, "Photo"},
-    {kCXNoteProperty, "Note"},
+    {kCXTitleProperty, marked("Title")},
+    {kCXNicknameProperty, marked("Nickname")},
+    {kCXMaidenNameProperty, marked("Maiden name")},
+    {kCXFirstNamePhoneticProperty, marked("First, phonetic")},
+    {kCXLastNamePhoneticProperty, marked("Last, phonetic")},
+    {kCXOrganizationProperty, marked("Organisation")},
+    {kCXDepartmentProperty, marked("Department")},
+    {kCXJobTitleProperty, marked("Job title")},
+    {kCXBirthdayProperty, marked("Birthday")},
+    {kCXBirthdayTextProperty, marked("Birthday")},
+    {kCXHomePageProperty, marked("Home page")},
+    {kCXCategoriesProperty, marked("Categories")},
+    {kCXPhotoProperty, marked("Photo")},
+    {kCXNoteProperty, marked("Note")},
 }};
-constexpr std::array<const char*, 7> kMultis{kCXPhoneProperty,     kCXEmailProperty,          kCXAddressProperty,
-                                             kCXURLsProperty,      kCXInstantMessageProperty, kCXRelatedNamesProperty,
-                                             kCXOtherDatesProperty};
+constexpr std::array<std::pair<const char*, const char*>, 7> kMultis{{
+    {kCXPhoneProperty, marked("Phone")},
+    {kCXEmailProperty, marked("Email")},
+    {kCXAddressProperty, marked("Address")},
+    {kCXURLsProperty, marked("URLs")},
+    {kCXInstantMessageProperty, marked("InstantMessage")},
+    {kCXRelatedNamesProperty, marked("RelatedNames")},
+    {kCXOtherDatesProperty, marked("OtherDates")},
+}};
 
-constexpr std::array<const char*, 12> kMonths{"January", "February", "March",     "April",   "May",      "June",
-                                              "July",    "August",   "September", "October", "November", "December"};
+constexpr std::array<const char*, 12> kMonths{marked("January"), marked("February"), marked("March"),
+                                              marked("April"),   marked("May"),      marked("June"),
+                                              marked("July"),    marked("August"),   marked("September"),
+                                              marked("October"), marked("November"), marked("December")};
 
 std::string dayOfYear(int month, int day) {
-    return fmt::format("{} {}", day, kMonths.at(static_cast<size_t>(month - 1)));
+    const char* name = translated(kMonths.at(static_cast<size_t>(month - 1)));
+    return tr("{} {}", day, name); // a day and its month
 }
 
 // A day as people write it where its year is not known: of such a date 1604 is the filling.
 std::string dayText(const std::string& iso) {
     const bool filled = iso.size() == 10 && iso.starts_with("1604-");
-    return filled ? dayOfYear(std::stoi(iso.substr(5, 2)), std::stoi(iso.substr(8, 2))) : iso;
+    return filled ? dayOfYear(std::stoi(iso.substr(5, 2)), std::stoi(iso.substr(8, 2))) : shownDay(iso);
 }
 
 // A birthday without its year, or with it alone, as vCards write it ("--0517", "1985-05").
@@ -199,8 +209,10 @@ std::string birthdayText(const std::string& text) {
     if (!vcardIsTruncatedDate(text) || text.size() != 7) return text;
     const int month = std::stoi(text.substr(5));
     if (month < 1 || month > 12) return text;
-    return fmt::format("{} {}", kMonths.at(static_cast<size_t>(month - 1)), text.substr(0, 4));
+    return fmt::format("{} {}", translated(kMonths.at(static_cast<size_t>(month - 1))), text.substr(0, 4));
 }
+
+} // namespace
 
 std::string oneLine(const Value& value) {
     if (const Dictionary* parts = value.dictionaryIf()) {
@@ -216,10 +228,12 @@ std::string oneLine(const Value& value) {
         for (const Value& item : *list) text += (text.empty() ? "" : ", ") + oneLine(item);
         return text;
     }
-    if (value.isData()) return fmt::format("{} bytes", value.data().size());
+    if (value.isData()) return tr("{} bytes", value.data().size());
     if (value.isDate()) return dayText(value.date()->toISO8601().substr(0, 10));
     return value.description();
 }
+
+namespace {
 
 void addLine(std::string& text, const std::string& label, const std::string& value) {
     std::string shown;
@@ -227,28 +241,31 @@ void addLine(std::string& text, const std::string& label, const std::string& val
         shown += c;
         if (c == '\n') shown += std::string(18, ' ');
     }
-    text += fmt::format("{:<18}{}\n", label, shown);
+    constexpr size_t kColumn = 18;
+    text += label + std::string(kColumn - std::min(kColumn - 1, columnsOf(label)), ' ') + shown + "\n";
 }
 
 } // namespace
 
 std::string personText(CXPerson& person) {
     std::string text = shownLine(person.displayName()) + "\n";
-    addLine(text, "Identifier", person.uniqueId().str());
-    if (!person.remoteLocation().empty()) addLine(text, "From", fromText(person));
+    addLine(text, translated("Identifier"), person.uniqueId().str());
+    if (!person.remoteLocation().empty()) addLine(text, translated("From"), fromText(person));
     for (const auto& [property, label] : kSingles)
         if (const Value value = person.valueForProperty(property)) {
             const bool isBirthday = property == std::string_view(kCXBirthdayTextProperty);
-            addLine(text, label, isBirthday ? birthdayText(value.string()) : oneLine(value));
+            addLine(text, translated(label), isBirthday ? birthdayText(value.string()) : oneLine(value));
         }
-    for (const char* property : kMultis)
+    for (const auto& [property, label] : kMultis)
         if (const auto values = person.multiValueForProperty(property))
             for (const CXMultiValue::Entry& entry : values->entries())
-                addLine(text, entry.label.empty() ? property : fmt::format("{} ({})", property, entry.label),
+                addLine(text,
+                        entry.label.empty() ? translated(label)
+                                            : fmt::format("{} ({})", translated(label), entry.label),
                         oneLine(entry.value));
     std::string groups;
     for (const CXGroupRef& group : person.parentGroups()) groups += (groups.empty() ? "" : ", ") + group->name();
-    if (!groups.empty()) addLine(text, "Groups", groups);
+    if (!groups.empty()) addLine(text, translated("Groups"), groups);
     text.pop_back();
     return text;
 }

@@ -25,6 +25,9 @@ nlohmann::ordered_json ownerJson(const RemoteLocation& location);
 // Whose a subscribed record is, where it came from, and whether it may be changed, as text for people.
 std::string fromText(const CXRecord& record);
 
+// A value for people, in one line.
+std::string oneLine(const Value& value);
+
 // A person as lines for people.
 std::string personText(CXPerson& person);
 

@@ -1,6 +1,5 @@
 #include "SeeingCommands.h"
 
-#include "Counted.h"
 #include "Lookup.h"
 #include "Publication.h"
 #include "RecordJson.h"
@@ -8,6 +7,7 @@
 #include "Shares.h"
 #include "Shown.h"
 #include "Subscriptions.h"
+#include "Texts.h"
 #include "ValueNames.h"
 
 #include <algorithm>
@@ -21,20 +21,18 @@ namespace {
 
 using Json = nlohmann::ordered_json;
 
-constexpr const char* kEverything = "all your contacts";
-
 const char* rightsOf(const Shares& shares, const std::string& user) {
     return shares.mayWrite(user) ? "write" : "read";
 }
 
 const char* rightsText(const Json& rights) {
-    return rights == "write" ? "read and write" : "read";
+    return rights == "write" ? translated("read and write") : translated("read");
 }
 
 // Through what the person is published: all contacts, or groups by name.
 std::vector<std::string> publishedThrough(CXRolvane& database, const CXPerson& person) {
     const Publication publication(database);
-    if (publication.everything()) return {kEverything};
+    if (publication.everything()) return {translated("all your contacts")};
     std::vector<std::string> names;
     for (const CXGroupRef& group : publication.groups()) {
         const auto members = group->memberUniqueIds();
@@ -62,7 +60,7 @@ void who(Context& context, const std::string& named) {
                                   {"owner", owner},
                                   {"through", nullptr},
                                   {"readers", nullptr}});
-        return context.say(fmt::format("{} is {}'s contact: {} decides who can see it.", name, owner, owner));
+        return context.say(tr("{} is {}'s contact: {} decides who can see it.", name, owner, owner));
     }
     const std::vector<std::string> through = publishedThrough(database, *person);
     const Shares shares(database);
@@ -77,13 +75,13 @@ void who(Context& context, const std::string& named) {
                               {"through", through},
                               {"readers", readers}});
     for (const Json& reader : readers)
-        context.line(fmt::format("{}  {}, through {}", reader["user"].get<std::string>(), rightsText(reader["rights"]),
-                                 listed(through)));
+        context.line(
+            tr("{}  {}, through {}", reader["user"].get<std::string>(), rightsText(reader["rights"]), listed(through)));
     if (through.empty())
-        context.say(fmt::format("Nobody but you: {} is in nothing that you publish.", name));
+        context.say(tr("Nobody but you: {} is in nothing that you publish.", name));
     else if (readers.empty())
-        context.say(fmt::format("Nobody but you: {} is published through {}, but you share with nobody.", name,
-                                listed(through)));
+        context.say(
+            tr("Nobody but you: {} is published through {}, but you share with nobody.", name, listed(through)));
 }
 
 // The content of the owner's tree: every reader sees all of it.
@@ -103,13 +101,13 @@ void preview(Context& context, const std::string& user) {
     CXRolvane& database = context.database();
     const Shares shares(database);
     if (!Publication(database).anything())
-        throw CommandError(kNotFound, fmt::format("\"{}\" gets nothing: nothing is published. `rolvane publish` comes "
-                                                  "first.",
-                                                  user));
+        throw CommandError(kNotFound, tr("\"{}\" gets nothing: nothing is published. `rolvane publish` comes "
+                                         "first.",
+                                         user));
     if (!shares.mayRead(user))
-        throw CommandError(kNotFound, fmt::format("\"{}\" gets nothing: you do not share with them. `rolvane shares` "
-                                                  "lists with whom you do.",
-                                                  user));
+        throw CommandError(kNotFound, tr("\"{}\" gets nothing: you do not share with them. `rolvane shares` "
+                                         "lists with whom you do.",
+                                         user));
     const Preview all = published(database);
     if (context.json) {
         Json people = Json::array(), groups = Json::array();
@@ -124,12 +122,12 @@ void preview(Context& context, const std::string& user) {
     }
     for (const CXGroupRef& group : all.groups)
         context.line(fmt::format("{}  ({})", shownLine(group->name()),
-                                 counted(group->memberUniqueIds().size(), "member", "members")));
+                                 countedText(group->memberUniqueIds().size(), "member", "members")));
     for (const CXListing& listing : all.people) context.line(shownLine(listing.displayName));
-    context.say(fmt::format("\"{}\" may {} {} and {}, as soon as the store has them.", user,
-                            shares.mayWrite(user) ? "read and change" : "read",
-                            counted(all.people.size(), "person", "people"),
-                            counted(all.groups.size(), "group", "groups")));
+    const std::string amount = amountText(all.people.size(), all.groups.size());
+    context.say(shares.mayWrite(user)
+                    ? tr("\"{}\" may read and change {}, as soon as the store has them.", user, amount)
+                    : tr("\"{}\" may read {}, as soon as the store has them.", user, amount));
 }
 
 } // namespace

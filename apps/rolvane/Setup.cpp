@@ -5,6 +5,7 @@
 #include "Publication.h"
 #include "Subscribe.h"
 #include "Subscriptions.h"
+#include "Texts.h"
 
 #include "foundation/Paths.h"
 #include "foundation/Preferences.h"
@@ -23,7 +24,10 @@ namespace {
 
 using Json = nlohmann::ordered_json;
 
-constexpr const char* kNothingSaved = "Nothing was saved.";
+const char* nothingSaved() {
+    return translated("Nothing was saved.");
+}
+
 constexpr int kAttempts = 3; // to type a password
 
 // An address as people have it, made an endpoint.
@@ -46,7 +50,7 @@ Setup::Setup(Context& context, SetupOptions options)
 void Setup::run() {
     chooseStore();
     chooseUser();
-    if (const auto problem = _account.problem()) throw CommandError(kUsage, *problem + " " + kNothingSaved);
+    if (const auto problem = _account.problem()) throw CommandError(kUsage, *problem + " " + nothingSaved());
     respectFormerAccount();
     if (_options.here) useStoreHere();
     trustAuthority();
@@ -65,15 +69,18 @@ void Setup::chooseStore() {
     const bool given = !_options.invitation.empty() || !_options.endpoint.empty() || _options.here;
     if (!given) {
         if (!_questions.mayAsk())
-            throw CommandError(kUsage, "Say which store: the line of an invitation, --endpoint ADDRESS, or --here for "
-                                       "a store on this machine. Nothing was saved.");
-        switch (_questions.choice("Where is the store that your contacts go to?",
-                                  {"I have an invitation: a line that begins with rolvane:",
-                                   "I know its address (any WebDAV server)", "On this machine: make one here"},
+            throw CommandError(
+                kUsage, translated("Say which store: the line of an invitation, --endpoint ADDRESS, or --here for "
+                                   "a store on this machine. Nothing was saved."));
+        switch (_questions.choice(translated("Where is the store that your contacts go to?"),
+                                  {translated("I have an invitation: a line that begins with rolvane:"),
+                                   translated("I know its address (any WebDAV server)"),
+                                   translated("On this machine: make one here")},
                                   0)) {
-        case 0: _options.invitation = _questions.text("The invitation's line"); break;
+        case 0: _options.invitation = _questions.text(translated("The invitation's line")); break;
         case 1:
-            _options.endpoint = _questions.text("Its address, such as https://dav.example.org/dav/{user}/Contacts");
+            _options.endpoint =
+                _questions.text(translated("Its address, such as https://dav.example.org/dav/{user}/Contacts"));
             break;
         default: _options.here = true; break;
         }
@@ -86,17 +93,16 @@ void Setup::chooseStore() {
                                        : "https://localhost/dav/{user}/Contacts"; // until it has chosen a port
         return;
     }
-    if (_options.endpoint.empty()) throw CommandError(kUsage, "The address is empty. Nothing was saved.");
+    if (_options.endpoint.empty()) throw CommandError(kUsage, translated("The address is empty. Nothing was saved."));
     _account.endpoint = endpointOf(_options.endpoint);
-    if (_account.endpoint != _options.endpoint)
-        _context.say(fmt::format("The address is taken as {}.", _account.endpoint));
+    if (_account.endpoint != _options.endpoint) _context.say(tr("The address is taken as {}.", _account.endpoint));
 }
 
 void Setup::takeInvitation(const std::string& line) {
     try {
         _invitation = Invitation::fromLine(line);
     } catch (const CXException& error) {
-        throw CommandError(kUsage, error.reason() + " " + kNothingSaved);
+        throw CommandError(kUsage, error.reason() + " " + nothingSaved());
     }
     _account.endpoint = _invitation->endpoint;
     _account.user = UserName(_invitation->user);
@@ -105,9 +111,10 @@ void Setup::takeInvitation(const std::string& line) {
 void Setup::chooseUser() {
     if (_invitation) return;
     std::string user = _options.user;
-    if (user.empty() && _options.here) user = _questions.text("Your user name on it", loginUserName());
-    if (user.empty()) user = _questions.text("Your user name there", _questions.mayAsk() ? loginUserName() : "");
-    if (user.empty()) throw CommandError(kUsage, "Name the user with --user. Nothing was saved.");
+    if (user.empty() && _options.here) user = _questions.text(translated("Your user name on it"), loginUserName());
+    if (user.empty())
+        user = _questions.text(translated("Your user name there"), _questions.mayAsk() ? loginUserName() : "");
+    if (user.empty()) throw CommandError(kUsage, translated("Name the user with --user. Nothing was saved."));
     _account.user = UserName(user);
 }
 
@@ -118,11 +125,11 @@ void Setup::useStoreHere() {
     _account.caFile = store.caFile();
     const std::vector<std::string> users = store.users();
     const std::string user = _account.user.str();
-    _context.say(fmt::format("A store runs on this machine, at {}.", _account.endpoint));
+    _context.say(tr("A store runs on this machine, at {}.", _account.endpoint));
     if (std::find(users.begin(), users.end(), user) != users.end()) return;
     _password = makePassword();
     store.addUser(user, _password);
-    _context.say(fmt::format("{} is a user of it now.", user));
+    _context.say(tr("{} is a user of it now.", user));
 }
 
 void Setup::respectFormerAccount() {
@@ -132,13 +139,13 @@ void Setup::respectFormerAccount() {
         if (!_former) return;
         const bool isSame = _former->user == _account.user && _former->endpoint == _account.endpoint;
         if (isSame) return;
-        held = fmt::format("The account of {} at {} is set up here already.", _former->user.str(), _former->endpoint);
+        held = tr("The account of {} at {} is set up here already.", _former->user.str(), _former->endpoint);
     } catch (const CXException& error) {
         held = error.reason();
     }
     _former.reset();
-    if (_options.replace || _questions.yes(held + " Replace it?", false)) return;
-    throw CommandError(kRefused, held + " `--replace` puts the new one in its place. Nothing was changed.");
+    if (_options.replace || _questions.yes(held + translated(" Replace it?"), false)) return;
+    throw CommandError(kRefused, held + translated(" `--replace` puts the new one in its place. Nothing was changed."));
 }
 
 // The authority ------------------------------------------------------------------------------------------------------
@@ -152,12 +159,12 @@ std::optional<PassFailure> Setup::reach(const PasswordSource& source) {
 
 void Setup::failWith(const PassFailure& failure) const {
     const FailureText text = failureText(failure, sceneOfTheAccount(Clock::system().now()));
-    throw CommandError(text.code, text.what + " " + text.toDo + " " + kNothingSaved);
+    throw CommandError(text.code, text.what + " " + text.toDo + " " + nothingSaved());
 }
 
 void Setup::trustAuthority() {
     if (!_options.caFile.empty()) _account.caFile = absolutePath(_options.caFile);
-    if (const auto problem = _account.problem()) throw CommandError(kUsage, *problem + " " + kNothingSaved);
+    if (const auto problem = _account.problem()) throw CommandError(kUsage, *problem + " " + nothingSaved());
     const std::string named = !_options.fingerprint.empty() ? _options.fingerprint
                               : _invitation                 ? _invitation->fingerprint
                                                             : std::string();
@@ -166,9 +173,10 @@ void Setup::trustAuthority() {
     if (!failure || isOfOnePassword(*failure)) return;
     if (failure->error != kCXDAVErrorSecureConnection || !_account.caFile.empty()) failWith(*failure);
     const FailureText text = failureText(*failure, sceneOfTheAccount(Clock::system().now()));
-    askToTrust({text.code,
-                text.what + " Give the authority with --ca-file FILE or --fingerprint SHA-256. " + kNothingSaved,
-                {}});
+    askToTrust(
+        {text.code,
+         text.what + translated(" Give the authority with --ca-file FILE or --fingerprint SHA-256. ") + nothingSaved(),
+         {}});
     if (const auto still = reach({}); still && !isOfOnePassword(*still)) failWith(*still);
 }
 
@@ -176,22 +184,21 @@ void Setup::trustAuthority() {
 void Setup::pin(const std::string& fingerprint) {
     const auto wanted = normalFingerprint(fingerprint);
     if (!wanted)
-        throw CommandError(kUsage, "The fingerprint \"" + fingerprint + "\" is no SHA-256 in hexadecimal digits. " +
-                                       kNothingSaved);
+        throw CommandError(kUsage, tr("The fingerprint \"{}\" is no SHA-256 in hexadecimal digits. ", fingerprint) +
+                                       nothingSaved());
     std::vector<ShownCertificate> chain;
     const Url store(_account.origins().back() + "/");
     try {
         chain = certificatesShownAt(store);
     } catch (const CXException& error) {
-        throw CommandError(kUnreachable, error.reason() + " " + kNothingSaved);
+        throw CommandError(kUnreachable, error.reason() + " " + nothingSaved());
     }
     const ShownCertificate* found = withFingerprint(chain, *wanted);
     if (!found)
-        throw CommandError(kRefused,
-                           fmt::format("The store at {} does not show the authority with the fingerprint {}. Somebody "
-                                       "may stand between you and it, or it has another authority by now. No password "
-                                       "was sent, and nothing was saved. Ask the store's owner for a new invitation.",
-                                       store.origin(), *wanted));
+        throw CommandError(kRefused, tr("The store at {} does not show the authority with the fingerprint {}. Somebody "
+                                        "may stand between you and it, or it has another authority by now. No password "
+                                        "was sent, and nothing was saved. Ask the store's owner for a new invitation.",
+                                        store.origin(), *wanted));
     std::string name;
     for (const char c : wanted->substr(0, 23))
         if (c != ':') name += c;
@@ -203,10 +210,10 @@ void Setup::askToTrust(const FailureText& why) {
     if (!_questions.mayAsk()) throw CommandError(why.code, why.what);
     const auto chain = certificatesShownAt(Url(_account.origins().back() + "/"));
     const ShownCertificate* authority = authorityOf(chain);
-    _context.warn(fmt::format("This machine does not know the authority of the store's certificate, \"{}\".\nIts "
-                              "SHA-256 fingerprint is\n  {}\nCompare it with the one that the store's owner tells you.",
-                              authority->subject, authority->fingerprint));
-    if (!_questions.yes("Are they the same?", false)) throw CommandError(why.code, why.what);
+    _context.warn(tr("This machine does not know the authority of the store's certificate, \"{}\".\nIts "
+                     "SHA-256 fingerprint is\n  {}\nCompare it with the one that the store's owner tells you.",
+                     authority->subject, authority->fingerprint));
+    if (!_questions.yes(translated("Are they the same?"), false)) throw CommandError(why.code, why.what);
     pin(authority->fingerprint);
 }
 
@@ -227,31 +234,35 @@ void Setup::choosePassword() {
     }
     if (!_questions.mayAsk()) {
         if (!isKnown && !_former)
-            throw CommandError(kUsage, "Say where the password comes from: --keyring or --ask-password with the "
-                                       "password on standard input, --password-command, --password-file, "
-                                       "--password-credential or --no-password. Nothing was saved.");
+            throw CommandError(kUsage,
+                               translated("Say where the password comes from: --keyring or --ask-password with the "
+                                          "password on standard input, --password-command, --password-file, "
+                                          "--password-credential or --no-password. Nothing was saved."));
         if (!isKnown)
             source = _former->passwordSource;
         else
             _keep = Keep::file;
         return;
     }
-    std::vector<std::string> offered{"In the keyring of this desktop (secret service)",
-                                     "In a file that only you can read"};
+    std::vector<std::string> offered{translated("In the keyring of this desktop (secret service)"),
+                                     translated("In a file that only you can read")};
     if (!isKnown) {
-        offered.emplace_back("Nowhere: a command prints it");
-        offered.emplace_back("Nowhere: the service manager has it as a credential");
+        offered.emplace_back(translated("Nowhere: a command prints it"));
+        offered.emplace_back(translated("Nowhere: the service manager has it as a credential"));
     }
-    switch (_questions.choice("Where shall the password be kept?", offered, secretServiceIsOpen() ? 0 : 1)) {
+    switch (
+        _questions.choice(translated("Where shall the password be kept?"), offered, secretServiceIsOpen() ? 0 : 1)) {
     case 0: _keep = Keep::keyring; break;
     case 1: _keep = Keep::file; break;
-    case 2: source = {Kind::command, _questions.text("The command; its first line of output is the password")}; break;
-    default: source = {Kind::credential, _questions.text("The credential's name")}; break;
+    case 2:
+        source = {Kind::command, _questions.text(translated("The command; its first line of output is the password"))};
+        break;
+    default: source = {Kind::credential, _questions.text(translated("The credential's name"))}; break;
     }
 }
 
 std::string Setup::typedPassword() {
-    return _questions.secret(fmt::format("Password of {}", _account.user.str()));
+    return _questions.secret(tr("Password of {}", _account.user.str()));
 }
 
 bool Setup::signsIn(const std::string& password) {
@@ -270,7 +281,7 @@ void Setup::signIn() {
         // The service manager gives a credential to the daemon alone.
         _wasTried = _account.passwordSource.kind != PasswordSource::Kind::credential || getenv("CREDENTIALS_DIRECTORY");
         if (!_wasTried) return;
-        if (const auto problem = _account.problem()) throw CommandError(kUsage, *problem + " " + kNothingSaved);
+        if (const auto problem = _account.problem()) throw CommandError(kUsage, *problem + " " + nothingSaved());
         requirePassword(_account);
         if (const auto failure = reach(_account.passwordSource)) failWith(*failure);
         return;
@@ -290,7 +301,7 @@ void Setup::signIn() {
         if (signsIn(typedPassword())) return;
         if (!_questions.mayAsk() || attempt == kAttempts)
             failWith({"", "", 401, kCXDAVErrorAuthentication, "", std::nullopt});
-        _context.warn("The store refused the user name or the password. Try again.");
+        _context.warn(translated("The store refused the user name or the password. Try again."));
     }
 }
 
@@ -306,12 +317,11 @@ void Setup::signInInvited() {
         _pending->stay(false);
         return;
     }
-    throw CommandError(kRefused,
-                       fmt::format("The store refuses the invitation's password: the line works once, and has "
-                                   "been used, or a newer one was made. Ask for another one: `rolvane store "
-                                   "user add {} --invite --renew`, typed by the store's owner, prints it. "
-                                   "Nothing was saved.",
-                                   _account.user.str()));
+    throw CommandError(kRefused, tr("The store refuses the invitation's password: the line works once, and has "
+                                    "been used, or a newer one was made. Ask for another one: `rolvane store "
+                                    "user add {} --invite --renew`, typed by the store's owner, prints it. "
+                                    "Nothing was saved.",
+                                    _account.user.str()));
 }
 
 // From then on the line is of no use to whoever has read it on its way.
@@ -322,7 +332,7 @@ void Setup::makeOwnPassword() {
     try {
         changePasswordOnStore(CXDAVManager::defaultManager(), _invitation->passwordPath, own);
     } catch (const CXException& error) {
-        throw CommandError(kFailed, error.reason() + " Run the same command again: it goes on from here.");
+        throw CommandError(kFailed, error.reason() + translated(" Run the same command again: it goes on from here."));
     }
     if (const auto failure = reach(_pending->source())) failWith(*failure);
     _password = own;
@@ -336,7 +346,7 @@ void Setup::tryStoreOut() {
     const bool publishes = Publication(_context.database()).anything();
     _published = publishedAlready(store, Preferences::shared(), publishes);
     _trial = tryStore(store);
-    if (_trial.hindrance) throw hinderedBy(*_trial.hindrance, kNothingSaved);
+    if (_trial.hindrance) throw hinderedBy(*_trial.hindrance, nothingSaved());
 }
 
 void Setup::keep() {
@@ -361,20 +371,23 @@ void Setup::tell() {
     }
     if (_wasTried)
         for (const std::string& line : consequences(_trial)) _context.say(line);
-    _context.say(fmt::format("The account of {} at {} is set up{}.", _account.user.str(), _account.endpoint,
-                             _wasTried ? ", and the store can be used" : ""));
+    _context.say(_wasTried ? tr("The account of {} at {} is set up, and the store can be used.", _account.user.str(),
+                                _account.endpoint)
+                           : tr("The account of {} at {} is set up.", _account.user.str(), _account.endpoint));
     if (!_wasTried)
-        return _context.say("The credential is known to the daemon alone, so nothing was tried. `rolvane status` tells "
-                            "how the daemon's passes go.");
+        return _context.say(
+            translated("The credential is known to the daemon alone, so nothing was tried. `rolvane status` tells "
+                       "how the daemon's passes go."));
     _context.say(publishedAlreadyText(_published));
-    if (_published.by == PublishedAlready::By::nobody) _context.say("`rolvane publish` publishes your contacts.");
+    if (_published.by == PublishedAlready::By::nobody)
+        _context.say(translated("`rolvane publish` publishes your contacts."));
 }
 
 void Setup::importContacts() {
     std::vector<std::string> files = _options.imports;
     if (files.empty() && _questions.mayAsk() && _context.database().countPeople(RemoteLocation("")) == 0) {
-        const std::string file =
-            _questions.text("A file of contacts to import (vCard, CSV or LDIF), or nothing to go on without");
+        const std::string file = _questions.text(
+            translated("A file of contacts to import (vCard, CSV or LDIF), or nothing to go on without"));
         if (!file.empty()) files.push_back(file);
     }
     if (!files.empty()) importFiles(_context, files);
@@ -387,9 +400,8 @@ void Setup::subscribeToInviter() {
     const bool wanted =
         _options.subscribes
             ? *_options.subscribes
-            : _questions.yes(fmt::format("Subscribe to the contacts of \"{}\"?", inviter), true) && _questions.mayAsk();
-    if (!wanted)
-        return _context.say(fmt::format("`rolvane subscribe {}` takes what {} shares with you.", inviter, inviter));
+            : _questions.yes(tr("Subscribe to the contacts of \"{}\"?", inviter), true) && _questions.mayAsk();
+    if (!wanted) return _context.say(tr("`rolvane subscribe {}` takes what {} shares with you.", inviter, inviter));
     try {
         subscribeTo(_context, inviter);
     } catch (const CommandError& error) { // the account stays

@@ -67,26 +67,27 @@ Json orNull(const std::optional<Date>& date) {
 
 // Refuses where the store cannot do what is asked.
 void requireAccessLists(Context& context, const Url& base, const std::string& user) {
-    requireStore(context, "Nothing was changed.");
+    requireStore(context, translated("Nothing was changed."));
     const auto keeps = CXDAVManager::defaultManager().keepsAccessLists();
     if (!keeps)
-        throw CommandError(kUnreachable, "The store does not say whether it keeps access lists. Nothing was changed; "
-                                         "try again later.");
+        throw CommandError(kUnreachable,
+                           translated("The store does not say whether it keeps access lists. Nothing was changed; "
+                                      "try again later."));
     if (*keeps) return;
     const auto place = CXDAVManager::defaultManager().account().endpointFor(base, true);
-    throw CommandError(kFailed, fmt::format("The store keeps no access lists (RFC 3744), so nothing was changed: who "
-                                            "may read is written in the server's own configuration. Ask its "
-                                            "administrator to let \"{}\" read {}, or to load mod_davacl.",
-                                            user, place ? place->absoluteString() : base.absoluteString()));
+    throw CommandError(kFailed, tr("The store keeps no access lists (RFC 3744), so nothing was changed: who "
+                                   "may read is written in the server's own configuration. Ask its "
+                                   "administrator to let \"{}\" read {}, or to load mod_davacl.",
+                                   user, place ? place->absoluteString() : base.absoluteString()));
 }
 
 std::string checkedUser(const std::string& user) {
     const std::string self = CXDAVManager::vaultraUser();
-    if (user.empty()) throw CommandError(kUsage, "Name the user.");
+    if (user.empty()) throw CommandError(kUsage, translated("Name the user."));
     if (userForRemoteLocation(
             RemoteLocation(CXDAVManager::ostrelBaseLocationForOstrelUser(UserName(user)).absoluteString()),
             UserName(self), {}) == kSelf)
-        throw CommandError(kRefused, fmt::format("\"{}\" is your own account, which may do everything.", user));
+        throw CommandError(kRefused, tr("\"{}\" is your own account, which may do everything.", user));
     return user;
 }
 
@@ -96,16 +97,17 @@ void takeBackOnStore(const Url& base, const std::string& user, bool reading) {
     CXDAVManager& manager = CXDAVManager::defaultManager();
     auto lists = storeLists(base);
     if (!lists)
-        throw CommandError(kUnreachable, "The store does not show its access list. Nothing was changed; try again "
-                                         "later.");
+        throw CommandError(kUnreachable,
+                           translated("The store does not show its access list. Nothing was changed; try again "
+                                      "later."));
     if (!StoreLists::in(lists->writers, user) && !(reading && StoreLists::in(lists->readers, user))) return;
     std::erase(lists->writers, user);
     if (reading) std::erase(lists->readers, user);
     if (manager.setACLsWithReadPrincipals(lists->readers, lists->writers, base)) return;
     const auto now = storeLists(base); // a list may be set and yet not be all that was asked for
     if (!now || StoreLists::in(now->writers, user) || (reading && StoreLists::in(now->readers, user)))
-        throw CommandError(kFailed,
-                           "The store did not take the right back. Nothing was changed here; try again later.");
+        throw CommandError(
+            kFailed, translated("The store did not take the right back. Nothing was changed here; try again later."));
 }
 
 // What the last writer wrote while it was allowed belongs to the owner, too, and a daemon that starts without a writer
@@ -114,7 +116,7 @@ void takeInWhatWasWritten(Context& context, double seconds) {
     try {
         makePass(context, seconds);
     } catch (const CXException& error) { // the right is taken back all the same
-        context.warn(fmt::format("What was written last may be missing here: {}", error.reason()));
+        context.warn(tr("What was written last may be missing here: {}", error.reason()));
     }
 }
 
@@ -127,7 +129,7 @@ std::optional<PassOutcome> carry(Context& context, PassWatch& watch, const Share
     const DaemonControl daemon;
     if (!daemon.start() && !watch.tell(kAllACLChanged).value_or(false)) daemon.restart();
     if (options.noWait) return std::nullopt;
-    PassOutcome outcome = waitForPass(context, watch, outcomes, "Sharing", position, options.timeout);
+    PassOutcome outcome = waitForPass(context, watch, outcomes, translated("Sharing"), position, options.timeout);
     const Shares shares(database);
     const auto agrees = [&] {
         const auto lists = storeLists(base);
@@ -139,15 +141,15 @@ std::optional<PassOutcome> carry(Context& context, PassWatch& watch, const Share
         done = agrees();
     }
     if (done) {
-        context.say("The store has it.");
+        context.say(translated("The store has it."));
         return outcome;
     }
     const PassTree* own = outcome.tree(kSelf);
     const bool toldWhy = !outcome.storeReached || !isComplete(outcome) || !own || own->ended || own->out.why;
     if (toldWhy && !report(context, outcome, {}, true)) return outcome;
-    throw CommandError(kFailed, fmt::format("The store did not take it. Perhaps it knows no user \"{0}\": check the "
-                                            "name, and take it back with `rolvane unshare {0}`.",
-                                            options.user));
+    throw CommandError(kFailed, tr("The store did not take it. Perhaps it knows no user \"{0}\": check the "
+                                   "name, and take it back with `rolvane unshare {0}`.",
+                                   options.user));
 }
 
 void tellSharing(Context& context, const ShareOptions& options, const std::string& user) {
@@ -161,13 +163,18 @@ void tellSharing(Context& context, const ShareOptions& options, const std::strin
         data["rightsNow"] = orNull(rightsHere(shares, user));
         context.print(data);
     }
-    context.say(same ? fmt::format("\"{}\" may do so already.", user)
-                     : fmt::format("{} {} \"{}\"{}. Nothing was changed: this was a trial.", shown.amount(),
-                                   shares.mayRead(user) ? (options.write ? "would become changeable for"
-                                                                         : "would no longer be changeable for")
-                                   : options.write      ? "would become readable and changeable for"
-                                                        : "would become readable for",
-                                   user, shares.mayRead(user) && !options.write ? ", who may go on reading" : ""));
+    const std::string amount = shown.amount(), trial = translated(" Nothing was changed: this was a trial.");
+    if (same)
+        context.say(tr("\"{}\" may do so already.", user));
+    else if (shares.mayRead(user))
+        context.say((options.write
+                         ? tr("{} would become changeable for \"{}\".", amount, user)
+                         : tr("{} would no longer be changeable for \"{}\", who may go on reading.", amount, user)) +
+                    trial);
+    else
+        context.say((options.write ? tr("{} would become readable and changeable for \"{}\".", amount, user)
+                                   : tr("{} would become readable for \"{}\".", amount, user)) +
+                    trial);
 }
 
 void changeShares(Context& context, const ShareOptions& options, bool grant) {
@@ -176,19 +183,20 @@ void changeShares(Context& context, const ShareOptions& options, bool grant) {
     CXRolvane& database = context.database();
     Shares shares(database);
     if (grant && !Publication(database).anything())
-        throw CommandError(kRefused, "Nothing is published yet, so there is nothing to share. `rolvane publish` comes "
-                                     "first.");
+        throw CommandError(kRefused,
+                           translated("Nothing is published yet, so there is nothing to share. `rolvane publish` comes "
+                                      "first."));
     if (!grant && !shares.mayRead(user)) {
         const auto lists = Publication(database).anything() ? storeLists(base) : std::nullopt;
         if (!lists || !lists->rightsOf(user))
-            throw CommandError(kNotFound, fmt::format("You do not share with \"{}\". `rolvane shares` lists with whom "
-                                                      "you do.",
-                                                      user));
+            throw CommandError(kNotFound, tr("You do not share with \"{}\". `rolvane shares` lists with whom "
+                                             "you do.",
+                                             user));
     }
     if (!Publication(database).anything()) { // the store has nothing of it: the right was kept for a next publication
         shares.deny(user);
         database.save();
-        context.say(fmt::format("\"{}\" will not read what you publish next.", user));
+        context.say(tr("\"{}\" will not read what you publish next.", user));
         if (context.json) context.print({{"user", user}, {"rights", nullptr}, {"pass", nullptr}});
         return;
     }
@@ -219,9 +227,9 @@ void changeShares(Context& context, const ShareOptions& options, bool grant) {
     } else {
         database.save();
     }
-    context.say(!grant          ? fmt::format("\"{}\" may no longer read your contacts.", user)
-                : options.write ? fmt::format("\"{}\" may read and change your contacts.", user)
-                                : fmt::format("\"{}\" may read your contacts, not change them.", user));
+    context.say(!grant          ? tr("\"{}\" may no longer read your contacts.", user)
+                : options.write ? tr("\"{}\" may read and change your contacts.", user)
+                                : tr("\"{}\" may read your contacts, not change them.", user));
     const auto outcome = options.noDaemon ? std::nullopt : carry(context, watch, options, base);
     if (context.json)
         context.print({{"user", user}, {"rights", orNull(rightsHere(shares, user))}, {"pass", outcomeJson(outcome)}});
@@ -249,23 +257,25 @@ void listShares(Context& context) {
                        {"agrees", lists ? Json(same(here, there)) : Json()}});
     }
     if (context.json) return context.print(all);
-    if (all.empty()) context.say("You share with nobody. `rolvane share USER` changes that.");
+    if (all.empty()) context.say(translated("You share with nobody. `rolvane share USER` changes that."));
     const auto words = [](const Json& rights) {
-        return rights.is_null() ? "nothing" : rights == "write" ? "read and write" : "read";
+        return rights.is_null()    ? translated("nothing")
+               : rights == "write" ? translated("read and write")
+                                   : translated("read");
     };
     const auto since = [](const Json& share) {
         const auto date = [&](const char* key) {
             return share[key].is_null() ? std::string("-") : shownDate(share[key].get<std::string>());
         };
         if (share["rights"].is_null()) return std::string();
-        const std::string writes = share["rights"] == "write" ? ", writes since " + date("writesSince") : "";
-        return "  reads since " + date("readsSince") + writes;
+        const std::string writes = share["rights"] == "write" ? tr(", writes since {}", date("writesSince")) : "";
+        return tr("  reads since {}", date("readsSince")) + writes;
     };
     for (const Json& share : all)
         context.line(fmt::format("{}  {}{}{}", share["user"].get<std::string>(), words(share["rights"]), since(share),
-                                 share["agrees"].is_null() ? "  (the store does not tell)"
+                                 share["agrees"].is_null() ? translated("  (the store does not tell)")
                                  : share["agrees"]         ? ""
-                                                           : fmt::format("  (the store: {})", words(share["store"]))));
+                                                           : tr("  (the store: {})", words(share["store"]))));
 }
 
 // rights -----------------------------------------------------------------------------------------------------------
@@ -281,7 +291,7 @@ void showRights(Context& context, const std::string& named) {
     (void)ownBase();
     const RemoteLocation location = namedLocation(named);
     const std::string user = publisherOf(location);
-    requireStore(context, "What you may do there is not known.");
+    requireStore(context, translated("What you may do there is not known."));
     const AccountOwner owner;
     bool read = false, write = false;
     const bool own = owner.userForRemoteLocation(location) == kSelf;
@@ -303,11 +313,14 @@ void showRights(Context& context, const std::string& named) {
                     {"write", own || lists ? Json(write) : Json()},
                     {"subscribed", subscription != nullptr}};
     if (context.json) return context.print(data);
-    context.line(
-        fmt::format("{}  {}{}", user, read ? (write ? "read and write" : "read") : "nothing",
-                    read && !own && !lists ? "  (the store keeps no access lists: copies are read only)" : ""));
+    context.line(fmt::format(
+        "{}  {}{}", user,
+        !read   ? translated("nothing")
+        : write ? translated("read and write")
+                : translated("read"),
+        read && !own && !lists ? translated("  (the store keeps no access lists: copies are read only)") : ""));
     if (subscription && subscription->isWritable() != write)
-        context.say(fmt::format("The last pass found otherwise; `rolvane sync` takes it in."));
+        context.say(tr("The last pass found otherwise; `rolvane sync` takes it in."));
 }
 
 } // namespace

@@ -9,6 +9,7 @@
 #include "Publication.h"
 #include "Shares.h"
 #include "Shown.h"
+#include "Texts.h"
 #include "ValueNames.h"
 
 #include "daemon/DaemonControl.h"
@@ -53,10 +54,10 @@ void removeWhatIsLeft(CXRolvane& database, const Url& base) {
     if (!left.anything()) return;
     whileDaemonRests([&] {
         if (const auto failure = left.remove())
-            throw notRemoved(*failure, fmt::format("Of an earlier withdrawal {} could not be removed from the store "
-                                                   "({}). Nothing was published; run the command again when the store "
-                                                   "can be reached.",
-                                                   failure->what, failure->answer()));
+            throw notRemoved(*failure, tr("Of an earlier withdrawal {} could not be removed from the store "
+                                          "({}). Nothing was published; run the command again when the store "
+                                          "can be reached.",
+                                          failure->what, failure->answer()));
     });
 }
 
@@ -86,13 +87,13 @@ Shown nextHidden(CXRolvane& database, const CXGroupRef& group) {
 }
 
 std::string namedWhole(const CXGroupRef& group) {
-    return group ? fmt::format("the group \"{}\"", group->name()) : "all contacts";
+    return group ? tr("the group \"{}\"", group->name()) : translated("all contacts");
 }
 
 void tellTrial(Context& context, const Shown& what, const std::vector<std::string>& users,
                const std::string& sentence) {
     if (context.json) context.print(trialJson(what, users));
-    context.say(sentence + " Nothing was changed: this was a trial.");
+    context.say(sentence + translated(" Nothing was changed: this was a trial."));
 }
 
 void tellPublishing(Context& context, const CXGroupRef& group, const Url& base) {
@@ -101,11 +102,11 @@ void tellPublishing(Context& context, const CXGroupRef& group, const Url& base) 
     const std::vector<std::string> readers = Shares(database).readers();
     const std::string what =
         more.empty() && (Publication(database).everything() || (group && Publication(database).publishes(group)))
-            ? fmt::format("Of {} everything is published already", namedWhole(group))
-            : fmt::format("{} would go to {}", more.amount(), base.absoluteString());
+            ? tr("Of {} everything is published already", namedWhole(group))
+            : tr("{} would go to {}", more.amount(), base.absoluteString());
     tellTrial(context, more, readers,
-              readers.empty() ? what + ". You share with nobody yet."
-                              : fmt::format("{}, readable for {}.", what, usersText(readers)));
+              readers.empty() ? tr("{}. You share with nobody yet.", what)
+                              : tr("{}, readable for {}.", what, usersText(readers)));
 }
 
 void askAboutReaders(Context& context, const PublishOptions& options, const CXGroupRef& group, const Url& base) {
@@ -113,10 +114,12 @@ void askAboutReaders(Context& context, const PublishOptions& options, const CXGr
     if (readers.empty()) return;
     const Shown more = newlyShown(context.database(), group, base);
     if (more.empty()) return;
-    requireConsent(context, options.yes,
-                   fmt::format("Publish {}? {} {} readable for {}.", namedWhole(group), more.amount(),
-                               more.isOne() ? "becomes" : "become", usersText(readers)),
-                   "Nothing was published.");
+    requireConsent(
+        context, options.yes,
+        more.isOne()
+            ? tr("Publish {}? {} becomes readable for {}.", namedWhole(group), more.amount(), usersText(readers))
+            : tr("Publish {}? {} become readable for {}.", namedWhole(group), more.amount(), usersText(readers)),
+        translated("Nothing was published."));
 }
 
 void publish(Context& context, const PublishOptions& options) {
@@ -130,9 +133,9 @@ void publish(Context& context, const PublishOptions& options) {
     if (const auto failure = testStore()) {
         const FailureText text = failureText(*failure, sceneOfTheAccount(Clock::system().now()));
         if (text.code == kRefused)
-            throw CommandError(kRefused, text.what + " " + text.toDo + " Nothing was published.");
+            throw CommandError(kRefused, text.what + " " + text.toDo + " " + translated("Nothing was published."));
     } else if (!served) {
-        requireUsableStore("Nothing was published.");
+        requireUsableStore(translated("Nothing was published."));
         if (!options.replace) requireOwnTree(CXDAVManager::defaultManager(), Preferences::shared());
     }
     askAboutReaders(context, options, group, base);
@@ -143,8 +146,9 @@ void publish(Context& context, const PublishOptions& options) {
     database.save();
     const int64_t position = database.journalPosition();
     OutcomeWatch outcomes(context);
-    const std::string what = group ? fmt::format("The group \"{}\"", group->name()) : "The contact list";
-    context.say(fmt::format("{} is published{} at {}.", what, changed ? "" : " already", base.absoluteString()));
+    const std::string what = group ? tr("The group \"{}\"", group->name()) : translated("The contact list");
+    context.say(changed ? tr("{} is published at {}.", what, base.absoluteString())
+                        : tr("{} is published already at {}.", what, base.absoluteString()));
     if (options.noDaemon) return;
     // A daemon that started with nothing shared serves nothing: it decides when it starts.
     const DaemonControl daemon;
@@ -154,10 +158,10 @@ void publish(Context& context, const PublishOptions& options) {
         daemon.start();
     if (options.noWait) return;
     if (!changed) return sync(context, options.timeout);
-    PassOutcome outcome = waitForPass(context, watch, outcomes, "Publishing", position, options.timeout);
+    PassOutcome outcome = waitForPass(context, watch, outcomes, translated("Publishing"), position, options.timeout);
     // A pass that the restart ended in the middle may have left a lock or a record behind.
     if (mayGoBetter(outcome)) outcome = makePass(context, options.timeout);
-    report(context, outcome, "Everything is on the store.", true);
+    report(context, outcome, translated("Everything is on the store."), true);
     if (!group && isComplete(outcome)) noteThisComputer(CXDAVManager::defaultManager(), Preferences::shared());
     if (context.json) context.print(outcomeJson(outcome));
 }
@@ -166,12 +170,12 @@ void publish(Context& context, const PublishOptions& options) {
 std::string withdraw(Publication& publication, LeftOnStore& left, const CXGroupRef& group) {
     if (!group) {
         withdrawAll(publication);
-        return "Nothing is published any more";
+        return translated("Nothing is published any more");
     }
     const bool wasLeft = left.isLeft(group->uniqueId());
     if (!publication.withdrawGroup(group) && !wasLeft)
-        throw CommandError(kNotFound, fmt::format("The group \"{}\" is not published by itself.", group->name()));
-    return fmt::format("The group \"{}\" is no longer published", group->name());
+        throw CommandError(kNotFound, tr("The group \"{}\" is not published by itself.", group->name()));
+    return tr("The group \"{}\" is no longer published", group->name());
 }
 
 void unpublishAtRest(Context& context, const PublishOptions& options, const CXGroupRef& group) {
@@ -198,31 +202,53 @@ void unpublishAtRest(Context& context, const PublishOptions& options, const CXGr
     if (options.keep) nothingLeft ? left.forgetTree() : left.forgetGroup(group->uniqueId());
 
     if (const auto failure = removes ? left.remove() : std::nullopt)
-        throw notRemoved(*failure, fmt::format("{}, but {} could not be removed from the store ({}). Run the command "
-                                               "again when the store can be reached; nothing else was lost.",
-                                               done, failure->what, failure->answer()));
+        throw notRemoved(*failure, tr("{}, but {} could not be removed from the store ({}). Run the command "
+                                      "again when the store can be reached; nothing else was lost.",
+                                      done, failure->what, failure->answer()));
     if (context.json)
         context.print({{"group", group ? nlohmann::ordered_json(group->name()) : nlohmann::ordered_json()},
                        {"stillPublished", publication.anything()},
                        {"removedFromStore", removes}});
-    context.say(done + (wholeListStays ? " by itself; it stays on the store as part of the contact list."
-                        : removes      ? ", and its files are off the store."
-                                       : "."));
+    context.say(wholeListStays ? tr("{} by itself; it stays on the store as part of the contact list.", done)
+                : removes      ? tr("{}, and its files are off the store.", done)
+                               : done + ".");
 }
 
 void tellWithdrawal(Context& context, const PublishOptions& options, const CXGroupRef& group) {
     CXRolvane& database = context.database();
     if (group && !Publication(database).publishes(group))
-        throw CommandError(kNotFound, fmt::format("The group \"{}\" is not published by itself.", group->name()));
+        throw CommandError(kNotFound, tr("The group \"{}\" is not published by itself.", group->name()));
     const Shown gone = nextHidden(database, group);
     const std::vector<std::string> readers = Shares(database).readers();
-    const char* where = options.keep ? "would no longer be kept in step on the store" : "would leave the store";
+    const std::string what = options.keep ? tr("{} would no longer be kept in step on the store", gone.amount())
+                                          : tr("{} would leave the store", gone.amount());
     tellTrial(context, gone, readers,
-              !Publication(database).anything() ? "Nothing is published."
-              : gone.empty()    ? "Nothing would leave the store: the group stays there as part of the contact list."
-              : readers.empty() ? fmt::format("{} {}. You share with nobody.", gone.amount(), where)
-                                : fmt::format("{} {}, where {} could read {}.", gone.amount(), where,
-                                              usersText(readers), gone.isOne() ? "it" : "them"));
+              !Publication(database).anything() ? translated("Nothing is published.")
+              : gone.empty()
+                  ? translated("Nothing would leave the store: the group stays there as part of the contact list.")
+              : readers.empty() ? tr("{}. You share with nobody.", what)
+              : gone.isOne()    ? tr("{}, where {} could read it.", what, usersText(readers))
+                                : tr("{}, where {} could read them.", what, usersText(readers)));
+}
+
+// "Take off the store 318 people? 1 user (bob) loses them."
+std::string withdrawalQuestion(const Shown& gone, const std::vector<std::string>& readers, bool keep) {
+    const std::string what = gone.amount(), users = usersText(readers);
+    const bool oneUser = readers.size() == 1, it = gone.isOne();
+    if (readers.empty())
+        return keep ? tr("Stop publishing {}? You share with nobody; the files stay there.", what)
+                    : tr("Take off the store {}? You share with nobody.", what);
+    if (keep && oneUser)
+        return it ? tr("Stop publishing {}? {} gets no more news of it; the files stay there.", what, users)
+                  : tr("Stop publishing {}? {} gets no more news of them; the files stay there.", what, users);
+    if (keep)
+        return it ? tr("Stop publishing {}? {} get no more news of it; the files stay there.", what, users)
+                  : tr("Stop publishing {}? {} get no more news of them; the files stay there.", what, users);
+    if (oneUser)
+        return it ? tr("Take off the store {}? {} loses it.", what, users)
+                  : tr("Take off the store {}? {} loses them.", what, users);
+    return it ? tr("Take off the store {}? {} lose it.", what, users)
+              : tr("Take off the store {}? {} lose them.", what, users);
 }
 
 // Asks before anything leaves the store, and anybody's database with it.
@@ -232,15 +258,8 @@ void askAboutWithdrawal(Context& context, const PublishOptions& options, const C
     const Shown gone = nextHidden(database, group);
     if (group && gone.empty()) return; // it stays as a part of the contact list
     const std::vector<std::string> readers = Shares(database).readers();
-    const char* verb = options.keep ? (readers.size() == 1 ? "gets no more news of" : "get no more news of")
-                                    : (readers.size() == 1 ? "loses" : "lose");
-    requireConsent(context, options.yes,
-                   fmt::format("{} {}? {}{}.", options.keep ? "Stop publishing" : "Take off the store", gone.amount(),
-                               readers.empty()
-                                   ? "You share with nobody"
-                                   : fmt::format("{} {} {}", usersText(readers), verb, gone.isOne() ? "it" : "them"),
-                               options.keep ? "; the files stay there" : ""),
-                   "Everything is still published.");
+    requireConsent(context, options.yes, withdrawalQuestion(gone, readers, options.keep),
+                   translated("Everything is still published."));
 }
 
 void unpublish(Context& context, const PublishOptions& options) {

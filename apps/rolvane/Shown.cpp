@@ -1,16 +1,16 @@
 #include "Shown.h"
 
-#include "Counted.h"
 #include "Publication.h"
 #include "SafeText.h"
+#include "Texts.h"
 
 #include "contacts/records/Identifier.h"
 
 namespace rolvane::cli {
 
 std::string Shown::amount() const {
-    const std::string text = counted(people.size(), "person", "people");
-    return groups.empty() ? text : text + " and " + counted(groups.size(), "group", "groups");
+    const std::string text = countedText(people.size(), "person", "people");
+    return groups.empty() ? text : amountText(people.size(), groups.size());
 }
 
 Shown shownToReaders(CXRolvane& database) {
@@ -31,14 +31,18 @@ Shown shownToReaders(CXRolvane& database) {
     return shown;
 }
 
+std::string amountText(size_t people, size_t groups) {
+    return tr("{} and {}", countedText(people, "person", "people"), countedText(groups, "group", "groups"));
+}
+
 std::string usersText(const std::vector<std::string>& users) {
     constexpr size_t kMost = 3;
     const size_t named = users.size() <= kMost ? users.size() : kMost - 1;
     std::string names;
     for (size_t i = 0; i < named; i++)
-        names += (i == 0 ? "" : i + 1 == users.size() ? " and " : ", ") + shownLine(users[i]);
-    if (named < users.size()) names += fmt::format(" and {} others", users.size() - named);
-    return counted(users.size(), "user", "users") + (users.empty() ? "" : " (" + names + ")");
+        names += (i == 0 ? "" : i + 1 == users.size() ? translated(" and ") : ", ") + shownLine(users[i]);
+    if (named < users.size()) names += tr(" and {} others", users.size() - named);
+    return countedText(users.size(), "user", "users") + (users.empty() ? "" : " (" + names + ")");
 }
 
 void declareTrial(CLI::App& command, bool& dryRun) {

@@ -20,6 +20,8 @@ struct Shown {
     bool isOne() const { return people.size() + groups.size() == 1; }
 };
 Shown shownToReaders(CXRolvane& database);
+// "318 people and 6 groups".
+std::string amountText(size_t people, size_t groups);
 // "1 user (bob)", "2 users (bob and cid)", "5 users (bob, cid and 3 others)".
 std::string usersText(const std::vector<std::string>& users);
 

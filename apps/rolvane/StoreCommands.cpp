@@ -1,8 +1,8 @@
 #include "Consent.h"
 #include "Context.h"
-#include "Counted.h"
 #include "Invite.h"
 #include "Terminal.h"
+#include "Texts.h"
 #include "ValueNames.h"
 
 #include "foundation/Paths.h"
@@ -53,8 +53,8 @@ void askServiceManager(const char* verb) {
     int status = 0;
     if (posix_spawnp(&pid, "systemctl", nullptr, nullptr, arguments, environ) != 0 || waitpid(pid, &status, 0) != pid ||
         status != 0)
-        throw CommandError(kFailed, fmt::format("`systemctl {} {}` failed. `journalctl -u {}` says why.", verb,
-                                                SystemStore::kUnit, SystemStore::kUnit));
+        throw CommandError(kFailed, tr("`systemctl {} {}` failed. `journalctl -u {}` says why.", verb,
+                                       SystemStore::kUnit, SystemStore::kUnit));
 }
 
 // From here on this process is one of the store's user, and so is everything that it writes or starts.
@@ -63,8 +63,9 @@ void becomeTheStoresUser(const StoreOptions& options, bool ports) {
     const StoreIdentity identity = StoreIdentity::named(SystemStore::kUser);
     if (geteuid() == identity.uid) return;
     if (geteuid() != 0)
-        throw CommandError(kRefused, "The store of this machine is its administrator's. Type sudo in front of the "
-                                     "command.");
+        throw CommandError(kRefused,
+                           translated("The store of this machine is its administrator's. Type sudo in front of the "
+                                      "command."));
     identity.takeOn(ports);
     setenv("HOME", SystemStore::kDirectory, 1);
     for (const char* name : {"XDG_CONFIG_HOME", "XDG_STATE_HOME", "XDG_DATA_HOME", "XDG_CACHE_HOME", "XDG_RUNTIME_DIR"})
@@ -94,7 +95,9 @@ void tell(Context& context, const PrivateStore& store) {
     const PrivateStoreStatus status = store.status();
     const std::string shown = store.certificateFile();
     const bool isOwn = shown.empty() || std::filesystem::path(shown).parent_path() == store.stateDirectory() + "/tls";
-    const std::string authority = isOwn && !shown.empty() ? store.caFile() : shown.empty() ? "none yet" : shown;
+    const std::string authority = isOwn && !shown.empty() ? store.caFile()
+                                  : shown.empty()         ? translated("none yet")
+                                                          : shown;
     const Json data{{"running", status.running},
                     {"process", status.running ? Json(status.pid) : Json()},
                     {"port", status.port ? Json(status.port) : Json()},
@@ -106,17 +109,15 @@ void tell(Context& context, const PrivateStore& store) {
                     {"errorLog", store.errorLog()},
                     {"users", store.users()}};
     if (context.json) return context.print(data);
-    const auto row = [&](const char* label, const std::string& text) {
-        context.line(fmt::format("{:<15}{}", label, text));
-    };
-    row("Store", status.running ? fmt::format("running, process {}", status.pid) : "stopped");
-    if (status.port) row("Endpoint", store.endpointTemplate());
-    row("Authority", authority);
-    row("Documents", store.documentRoot());
-    row("Log", store.errorLog());
+    const auto row = [&](const char* label, const std::string& text) { context.row(label, text); };
+    row(translated("Store"), status.running ? tr("running, process {}", status.pid) : translated("stopped"));
+    if (status.port) row(translated("Endpoint"), store.endpointTemplate());
+    row(translated("Authority"), authority);
+    row(translated("Documents"), store.documentRoot());
+    row(translated("Log"), store.errorLog());
     std::string users;
     for (const std::string& user : store.users()) users += (users.empty() ? "" : ", ") + user;
-    row("Users", users.empty() ? "none (`rolvane store user add`)" : users);
+    row(translated("Users"), users.empty() ? translated("none (`rolvane store user add`)") : users);
 }
 
 void start(Context& context, CLI::App& command, const StoreOptions& options) {
@@ -148,7 +149,7 @@ void stop(Context& context, const StoreOptions& options) {
     PrivateStore store(knownOptions(options));
     const bool ran = store.status().running;
     store.stop(options.now ? PrivateStore::Stop::atOnce : PrivateStore::Stop::gracefully);
-    context.say(ran ? "The store is stopped; its files stay." : "The store was not running.");
+    context.say(ran ? translated("The store is stopped; its files stay.") : translated("The store was not running."));
 }
 
 // httpd's ACME module calls with what has happened; the one thing that matters is another certificate.
@@ -157,8 +158,8 @@ void reload(Context& context, const StoreOptions& options) {
     if (!options.eventWords.empty() && options.eventWords.front() != kRenewed) return;
     becomeTheStoresUser(options, false);
     if (!PrivateStore(settledOptions(options)).reload())
-        throw CommandError(kNotFound, "The store does not run. `rolvane store start` starts it.");
-    context.say("The store has taken its settings and certificates in.");
+        throw CommandError(kNotFound, translated("The store does not run. `rolvane store start` starts it."));
+    context.say(translated("The store has taken its settings and certificates in."));
 }
 
 void backup(Context& context, const StoreOptions& options) {
@@ -169,12 +170,13 @@ void backup(Context& context, const StoreOptions& options) {
     if (std::filesystem::is_directory(file, error))
         file = backup.writeInto(file, options.keep);
     else if (options.keep > 0)
-        throw CommandError(kUsage, "--keep needs a directory, where the backups have names with their dates.");
+        throw CommandError(kUsage,
+                           translated("--keep needs a directory, where the backups have names with their dates."));
     else
         backup.write(file);
-    context.say(fmt::format("The store is in {}, with everything that signs its users in: keep it where nobody else "
-                            "reads it.",
-                            file == "-" ? "what was written" : file));
+    context.say(tr("The store is in {}, with everything that signs its users in: keep it where nobody else "
+                   "reads it.",
+                   file == "-" ? translated("what was written") : file));
 }
 
 void restoreBackup(Context& context, const StoreOptions& options) {
@@ -182,11 +184,11 @@ void restoreBackup(Context& context, const StoreOptions& options) {
     const PrivateStoreOptions known = knownOptions(options);
     CXPathUtils_MakeCompletePath(PrivateStore(known).stateDirectory() + "/conf", 0700);
     requireConsent(context, options.yes,
-                   fmt::format("Put the store of {} in the place of the one that is here, with {}?", options.file,
-                               counted(PrivateStore(known).users().size(), "user", "users")),
-                   "Nothing was changed.");
+                   tr("Put the store of {} in the place of the one that is here, with {}?", options.file,
+                      countedText(PrivateStore(known).users().size(), "user", "users")),
+                   translated("Nothing was changed."));
     const std::string former = StoreBackup(known).restore(options.file);
-    context.say(fmt::format("The store of the backup is here. What was here before is in {}.", former));
+    context.say(tr("The store of the backup is here. What was here before is in {}.", former));
 }
 
 void quota(Context& context, const StoreOptions& options) {
@@ -194,15 +196,14 @@ void quota(Context& context, const StoreOptions& options) {
     PrivateStore store(knownOptions(options));
     const std::vector<std::string> users = store.users();
     const bool isKnown = std::find(users.begin(), users.end(), options.user) != users.end();
-    if (!options.user.empty() && !isKnown)
-        throw CommandError(kNotFound, fmt::format("The store has no user {}.", options.user));
+    if (!options.user.empty() && !isKnown) throw CommandError(kNotFound, tr("The store has no user {}.", options.user));
     if (!options.quota.empty()) {
         if (options.quota != "default" && !isQuota(options.quota))
-            throw CommandError(kUsage,
-                               fmt::format("\"{}\" is no quota: write 500M, 2G, none, or default.", options.quota));
+            throw CommandError(kUsage, tr("\"{}\" is no quota: write 500M, 2G, none, or default.", options.quota));
         if (store.roomOf(options.user).quota.empty())
-            throw CommandError(kFailed, "This store keeps no quotas. A line such as `quota = 1G` in its settings and "
-                                        "`rolvane store reload` begin with it.");
+            throw CommandError(kFailed,
+                               translated("This store keeps no quotas. A line such as `quota = 1G` in its settings and "
+                                          "`rolvane store reload` begin with it."));
         store.setQuota(options.user, options.quota == "default" ? "" : options.quota);
     }
     Json all = Json::array();
@@ -217,41 +218,43 @@ void quota(Context& context, const StoreOptions& options) {
     if (context.json) return context.print(all);
     for (const Json& row : all) {
         constexpr double kMega = 1 << 20;
-        const std::string used =
-            row["used"].is_null() ? "not counted yet" : fmt::format("{:.1f}M", row["used"].get<double>() / kMega);
-        context.line(fmt::format("{:<20} {:>15} of {}{}", row["user"].get<std::string>(), used,
-                                 row["quota"].get<std::string>(), row["own"].get<bool>() ? " (own)" : ""));
+        const std::string used = row["used"].is_null() ? translated("not counted yet")
+                                                       : fmt::format("{:.1f}M", row["used"].get<double>() / kMega);
+        context.line(tr("{:<20} {:>15} of {}{}", row["user"].get<std::string>(), used, row["quota"].get<std::string>(),
+                        row["own"].get<bool>() ? translated(" (own)") : ""));
     }
 }
 
 std::string newPassword(const std::string& user) {
-    const std::string password = readSecret("New password of " + user + ": ");
-    if (password.empty()) throw CommandError(kUsage, "The password is empty. Nothing was changed.");
+    const std::string password = readSecret(tr("New password of {}: ", user));
+    if (password.empty()) throw CommandError(kUsage, translated("The password is empty. Nothing was changed."));
     return password;
 }
 
 // The store has to show its authority to whoever is to find it by its fingerprint.
 void requireShownAuthority(const PrivateStore& store, const std::string& fingerprint) {
     if (!store.status().running)
-        throw CommandError(kFailed, "The store does not run. `rolvane store start` starts it; then invite again.");
+        throw CommandError(kFailed,
+                           translated("The store does not run. `rolvane store start` starts it; then invite again."));
     if (!fingerprint.empty() && !withFingerprint(certificatesShownAt(Url(store.localURL())), fingerprint))
-        throw CommandError(kFailed, "The store was started by an earlier version and does not show its authority yet. "
-                                    "`rolvane store stop && rolvane store start`, then invite again.");
+        throw CommandError(
+            kFailed, translated("The store was started by an earlier version and does not show its authority yet. "
+                                "`rolvane store stop && rolvane store start`, then invite again."));
 }
 
 void invite(Context& context, const StoreOptions& options) {
     PrivateStore store(knownOptions(options));
     const std::vector<std::string> users = store.users();
     if (!options.renew && std::find(users.begin(), users.end(), options.user) != users.end())
-        throw CommandError(kRefused,
-                           fmt::format("There is a user {0} already. `--renew` gives {0} a new first password, "
-                                       "and the one that {0} has ends.",
-                                       options.user));
+        throw CommandError(kRefused, tr("There is a user {0} already. `--renew` gives {0} a new first password, "
+                                        "and the one that {0} has ends.",
+                                        options.user));
     Invitation invitation;
     invitation.endpoint = store.endpointTemplate();
     if (!invitation.endpoint.starts_with("https:"))
-        throw CommandError(kFailed, "The store speaks plain http, and an invitation holds a password. Start it with "
-                                    "TLS.");
+        throw CommandError(kFailed,
+                           translated("The store speaks plain http, and an invitation holds a password. Start it with "
+                                      "TLS."));
     invitation.user = options.user;
     invitation.fingerprint = store.authorityFingerprint();
     requireShownAuthority(store, invitation.fingerprint);
@@ -260,7 +263,7 @@ void invite(Context& context, const StoreOptions& options) {
     invitation.inviter = !options.inviter.empty() || options.system ? options.inviter : inviterOn(invitation.endpoint);
     if (!invitation.inviter.empty() && !options.inviter.empty() &&
         std::find(users.begin(), users.end(), options.inviter) == users.end())
-        throw CommandError(kNotFound, fmt::format("The store has no user {}.", options.inviter));
+        throw CommandError(kNotFound, tr("The store has no user {}.", options.inviter));
     store.addUser(options.user, invitation.password);
     printInvitation(context, invitation, options.qr);
 }
@@ -270,7 +273,7 @@ void addUser(Context& context, const StoreOptions& options) {
     if (options.invite) return invite(context, options);
     PrivateStore known(knownOptions(options));
     known.addUser(options.user, newPassword(options.user));
-    context.say(fmt::format("{} can sign in.", options.user));
+    context.say(tr("{} can sign in.", options.user));
 }
 
 size_t filesBelow(const std::string& directory) {
@@ -286,17 +289,15 @@ void removeUser(Context& context, const StoreOptions& options) {
     becomeTheStoresUser(options, false);
     PrivateStore store(knownOptions(options));
     const std::vector<std::string> users = store.users();
-    const auto unknown = [&] {
-        return CommandError(kNotFound, fmt::format("The store has no user {}.", options.user));
-    };
+    const auto unknown = [&] { return CommandError(kNotFound, tr("The store has no user {}.", options.user)); };
     if (std::find(users.begin(), users.end(), options.user) == users.end()) throw unknown();
     const std::string directory = store.userDirectory(options.user);
     requireConsent(context, options.yes,
-                   fmt::format("Take the account of {} away? {} of it stay in {}, and nobody signs in as {} any more.",
-                               options.user, counted(filesBelow(directory), "file", "files"), directory, options.user),
-                   "The account stays.");
+                   tr("Take the account of {} away? {} of it stay in {}, and nobody signs in as {} any more.",
+                      options.user, countedText(filesBelow(directory), "file", "files"), directory, options.user),
+                   translated("The account stays."));
     if (!store.removeUser(options.user)) throw unknown();
-    context.say(fmt::format("{} can no longer sign in.", options.user));
+    context.say(tr("{} can no longer sign in.", options.user));
 }
 
 } // namespace

@@ -1,7 +1,6 @@
 #include "AskAgain.h"
 #include "Consent.h"
 #include "Context.h"
-#include "Counted.h"
 #include "FailureText.h"
 #include "PassReport.h"
 #include "Passes.h"
@@ -49,25 +48,25 @@ void requirePublication(Context& context, const RemoteLocation& location) {
     do {
         if (store.dictionaryAtURL(info, false, &code)) return;
         requests = takeFailures(store);
-        requireStore(context, "Nothing was subscribed to.");
+        requireStore(context, translated("Nothing was subscribed to."));
     } while (code != kForbidden && code != kMissing && !requests.empty() && again.after(requests.back()));
     if (code == kForbidden)
-        throw CommandError(kRefused, fmt::format("The store does not let you read the contacts of \"{0}\". Check the "
-                                                 "name, or ask for the right to read: `rolvane share {1}`, typed by "
-                                                 "{0}, grants it.",
-                                                 user, self));
+        throw CommandError(kRefused, tr("The store does not let you read the contacts of \"{0}\". Check the "
+                                        "name, or ask for the right to read: `rolvane share {1}`, typed by "
+                                        "{0}, grants it.",
+                                        user, self));
     if (code == kMissing)
-        throw CommandError(kNotFound, fmt::format("\"{0}\" has published nothing on this store. Check the name, or ask "
-                                                  "{0} to publish, with `rolvane publish`.",
-                                                  user));
+        throw CommandError(kNotFound, tr("\"{0}\" has published nothing on this store. Check the name, or ask "
+                                         "{0} to publish, with `rolvane publish`.",
+                                         user));
     FailureScene scene = sceneOfTheAccount(Clock::system().now());
     scene.user = user;
     scene.reads = true;
-    const FailureText text = requests.empty() ? FailureText{kUnreachable, "The store did not answer.", {}}
+    const FailureText text = requests.empty() ? FailureText{kUnreachable, translated("The store did not answer."), {}}
                                               : failureText(requests.back(), scene);
-    throw CommandError(text.code, fmt::format("What \"{}\" has published could not be read. {} Nothing was subscribed "
-                                              "to; try again later.",
-                                              user, text.what));
+    throw CommandError(text.code, tr("What \"{}\" has published could not be read. {} Nothing was subscribed "
+                                     "to; try again later.",
+                                     user, text.what));
 }
 
 Json described(CXRolvane& database, const CXSubscriptionRef& subscription) {
@@ -85,8 +84,7 @@ Json described(CXRolvane& database, const CXSubscriptionRef& subscription) {
 }
 
 std::string amount(const Json& subscription) {
-    return counted(subscription["people"].get<size_t>(), "person", "people") + " and " +
-           counted(subscription["groups"].get<size_t>(), "group", "groups");
+    return amountText(subscription["people"].get<size_t>(), subscription["groups"].get<size_t>());
 }
 
 // subscribe --------------------------------------------------------------------------------------------------------
@@ -104,7 +102,7 @@ void waitForPeople(Context& context, PassWatch& watch, OutcomeWatch& outcomes, c
                    int64_t position, double seconds) {
     CXRolvane& database = context.database();
     const std::string user = publisherOf(location);
-    PassOutcome outcome = waitForPass(context, watch, outcomes, "Fetching", position, seconds);
+    PassOutcome outcome = waitForPass(context, watch, outcomes, translated("Fetching"), position, seconds);
     const auto cameWhole = [&] {
         const PassTree* tree = outcome.tree(UserName(user));
         return isComplete(outcome) && tree && tree->in.reached && tree->in.waiting == 0;
@@ -120,17 +118,18 @@ void waitForPeople(Context& context, PassWatch& watch, OutcomeWatch& outcomes, c
     }
     const CXSubscriptionRef subscription = database.findSubscriptionWithRemoteLocation(location);
     if (!subscription)
-        throw CommandError(kRefused, fmt::format("The store let go of the contacts of \"{}\" while they were fetched: "
-                                                 "they are withdrawn, and the subscription has ended.",
-                                                 user));
-    if (!cameWhole()) context.warn(fmt::format("Not all contacts of \"{}\" have come yet.", user));
+        throw CommandError(kRefused, tr("The store let go of the contacts of \"{}\" while they were fetched: "
+                                        "they are withdrawn, and the subscription has ended.",
+                                        user));
+    if (!cameWhole()) context.warn(tr("Not all contacts of \"{}\" have come yet.", user));
     const bool well = report(context, outcome, {});
     Json data = described(database, subscription);
     data["pass"] = outcomeJson(outcome);
     if (context.json) context.print(data);
     if (well && cameWhole())
-        context.say(fmt::format("{} of \"{}\" are here; you may {}.", amount(data), user,
-                                data["writable"].get<bool>() ? "change them" : "read them but not change them"));
+        context.say(data["writable"].get<bool>()
+                        ? tr("{} of \"{}\" are here; you may change them.", amount(data), user)
+                        : tr("{} of \"{}\" are here; you may read them but not change them.", amount(data), user));
     else if (well)
         context.exitCode = kFailed;
 }
@@ -141,15 +140,14 @@ void tellSubscribing(Context& context, const RemoteLocation& location) {
         layout::groupLocation(Url(location.str()), UniqueId(layout::kAllGroup)), false, nullptr);
     const std::string user = publisherOf(location);
     if (!all)
-        throw CommandError(
-            kUnreachable,
-            fmt::format("The list of what \"{}\" has published could not be read. Try again later.", user));
+        throw CommandError(kUnreachable,
+                           tr("The list of what \"{}\" has published could not be read. Try again later.", user));
     const size_t people = (*all)["memberUIDState"].array().count(), groups = (*all)["subgroupUIDState"].array().count();
     if (context.json)
         context.print(Json{
             {"dryRun", true}, {"user", user}, {"location", location.str()}, {"people", people}, {"groups", groups}});
-    context.say(fmt::format("{} and {} of \"{}\" would come. Nothing was changed: this was a trial.",
-                            counted(people, "person", "people"), counted(groups, "group", "groups"), user));
+    context.say(tr("{} and {} of \"{}\" would come. Nothing was changed: this was a trial.",
+                   countedText(people, "person", "people"), countedText(groups, "group", "groups"), user));
 }
 
 void subscribe(Context& context, const SubscribeOptions& options) {
@@ -157,15 +155,14 @@ void subscribe(Context& context, const SubscribeOptions& options) {
     const RemoteLocation location = namedLocation(options.named);
     const std::string user = publisherOf(location), self = CXDAVManager::vaultraUser();
     if (userForRemoteLocation(location, UserName(self), {}) == kSelf)
-        throw CommandError(kRefused,
-                           fmt::format("\"{}\" is your own account. `rolvane join` brings what another computer "
-                                       "has published of it; `rolvane publish` shares what is here.",
-                                       user));
+        throw CommandError(kRefused, tr("\"{}\" is your own account. `rolvane join` brings what another computer "
+                                        "has published of it; `rolvane publish` shares what is here.",
+                                        user));
     CXRolvane& database = context.database();
     if (database.findSubscriptionWithRemoteLocation(location))
-        throw CommandError(kRefused, fmt::format("You are subscribed to \"{}\" already. `rolvane sync` brings what is "
-                                                 "new, `rolvane subscriptions` tells how it stands.",
-                                                 user));
+        throw CommandError(kRefused, tr("You are subscribed to \"{}\" already. `rolvane sync` brings what is "
+                                        "new, `rolvane subscriptions` tells how it stands.",
+                                        user));
     requirePublication(context, location);
     if (options.dryRun) return tellSubscribing(context, location);
 
@@ -175,7 +172,7 @@ void subscribe(Context& context, const SubscribeOptions& options) {
     database.save();
     const int64_t position = database.journalPosition();
     OutcomeWatch outcomes(context);
-    context.say(fmt::format("You are subscribed to \"{}\" at {}.", user, location.str()));
+    context.say(tr("You are subscribed to \"{}\" at {}.", user, location.str()));
     if (!options.noDaemon) startDaemonFor(watch, served);
     if (!options.noDaemon && !options.noWait)
         waitForPeople(context, watch, outcomes, location, position, options.timeout);
@@ -194,10 +191,12 @@ void unsubscribe(Context& context, const std::string& named, bool yes) {
     const size_t unsent = unsentTo(database, Preferences::shared(), location);
     if (unsent > 0)
         requireConsent(context, yes,
-                       fmt::format("Unsubscribe from \"{}\"? {} of yours {} not been sent yet, and {} dropped.",
-                                   publisherOf(location), counted(unsent, "change", "changes"),
-                                   unsent == 1 ? "has" : "have", unsent == 1 ? "is" : "are"),
-                       "You are still subscribed.");
+                       unsent == 1
+                           ? tr("Unsubscribe from \"{}\"? 1 change of yours has not been sent yet, and is dropped.",
+                                publisherOf(location))
+                           : tr("Unsubscribe from \"{}\"? {} changes of yours have not been sent yet, and are dropped.",
+                                publisherOf(location), shownNumber(unsent)),
+                       translated("You are still subscribed."));
     const DaemonControl daemon;
     const bool ran = daemon.stop();
     const size_t lost = unsentTo(database, Preferences::shared(), location);
@@ -214,11 +213,11 @@ void unsubscribe(Context& context, const std::string& named, bool yes) {
     context.bus().post({kSubscriptionListChanged, std::nullopt, {}});
     if (ran) daemon.start();
     if (context.json) context.print(data);
-    context.say(fmt::format("You are no longer subscribed to \"{}\"; {} left with it.", data["user"].get<std::string>(),
-                            amount(data)));
+    context.say(
+        tr("You are no longer subscribed to \"{}\"; {} left with it.", data["user"].get<std::string>(), amount(data)));
     if (lost > 0)
-        context.warn(fmt::format("{} of yours had not been sent yet and {} dropped.",
-                                 counted(lost, "change", "changes"), lost == 1 ? "is" : "are"));
+        context.warn(lost == 1 ? translated("1 change of yours had not been sent yet and is dropped.")
+                               : tr("{} changes of yours had not been sent yet and are dropped.", shownNumber(lost)));
 }
 
 // subscriptions ----------------------------------------------------------------------------------------------------
@@ -228,14 +227,16 @@ void listSubscriptions(Context& context) {
     Json all = Json::array();
     for (const CXSubscriptionRef& s : subscriptionsToPeople(database)) all.push_back(described(database, s));
     if (context.json) return context.print(all);
-    if (all.empty()) context.say("There is none. `rolvane subscribe USER` makes one.");
+    if (all.empty()) context.say(translated("There is none. `rolvane subscribe USER` makes one."));
     for (const Json& s : all) {
         context.line(fmt::format("{}  {}", s["user"].get<std::string>(), s["location"].get<std::string>()));
-        context.line(fmt::format(
-            "    {}, {}, {}", amount(s), s["writable"].get<bool>() ? "read and write" : "read only",
-            s["lastSeen"].is_null() ? "not read yet" : "last seen " + shownDate(s["lastSeen"].get<std::string>())));
+        context.line(fmt::format("    {}, {}, {}", amount(s),
+                                 s["writable"].get<bool>() ? translated("read and write") : translated("read only"),
+                                 s["lastSeen"].is_null()
+                                     ? translated("not read yet")
+                                     : tr("last seen {}", shownDate(s["lastSeen"].get<std::string>()))));
         if (const size_t pending = s["pending"]; pending > 0)
-            context.line(fmt::format("    {} to be sent", counted(pending, "change waits", "changes wait")));
+            context.line(tr("    {} to be sent", countedText(pending, "change waits", "changes wait")));
     }
 }
 

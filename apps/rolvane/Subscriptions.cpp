@@ -2,6 +2,7 @@
 
 #include "Context.h"
 #include "Publication.h"
+#include "Texts.h"
 #include "ValueNames.h"
 
 #include "conduits/PublishedLayout.h"
@@ -37,21 +38,21 @@ RemoteLocation namedLocation(const std::string& named) {
     const auto baseOf = [](const std::string& user) {
         return RemoteLocation(CXDAVManager::ostrelBaseLocationForOstrelUser(UserName(user)).absoluteString());
     };
-    if (named.empty()) throw CommandError(kUsage, "Name the user whose contacts you want.");
+    if (named.empty()) throw CommandError(kUsage, translated("Name the user whose contacts you want."));
     const bool isLocation = named.find(':') != std::string::npos || named.find('/') != std::string::npos;
     if (!isLocation) return baseOf(named);
     std::string text = named;
     while (text.ends_with('/')) text.pop_back();
     const RemoteLocation location(text);
     if (syncSourceForRemoteLocation(location) != CXDSyncSourceVaultra)
-        throw CommandError(kUsage, fmt::format("\"{}\" is no location of a store. Give the user's name, or a location "
-                                               "like {}.",
-                                               named, baseOf("alice").str()));
+        throw CommandError(kUsage, tr("\"{}\" is no location of a store. Give the user's name, or a location "
+                                      "like {}.",
+                                      named, baseOf("alice").str()));
     const std::string user = publisherOf(location);
     if (user.empty() || baseOf(user) != location)
-        throw CommandError(kNotFound, fmt::format("{} is not on the store of your account, where locations are like "
-                                                  "{}. Give the user's name instead.",
-                                                  named, baseOf(user.empty() ? "alice" : user).str()));
+        throw CommandError(kNotFound, tr("{} is not on the store of your account, where locations are like "
+                                         "{}. Give the user's name instead.",
+                                         named, baseOf(user.empty() ? "alice" : user).str()));
     return location;
 }
 
@@ -85,13 +86,13 @@ CXSubscriptionRef findSubscription(CXRolvane& database, const std::string& named
             if (folded(publisherOf(s->remoteLocation())) == folded(named)) found.push_back(s);
     if (found.size() == 1) return found.front();
     if (found.empty())
-        throw CommandError(kNotFound, fmt::format("There is no subscription to \"{}\". `rolvane subscriptions` lists "
-                                                  "what there is.",
-                                                  named));
+        throw CommandError(kNotFound, tr("There is no subscription to \"{}\". `rolvane subscriptions` lists "
+                                         "what there is.",
+                                         named));
     std::string list;
     for (const CXSubscriptionRef& s : found) list += "\n  " + s->remoteLocation().str();
-    throw CommandError(
-        kNotFound, fmt::format("\"{}\" fits {} subscriptions. Name one by its location:{}", named, found.size(), list));
+    throw CommandError(kNotFound,
+                       tr("\"{}\" fits {} subscriptions. Name one by its location:{}", named, found.size(), list));
 }
 
 void declareWhose(CLI::App& command, Whose& whose) {

@@ -1,5 +1,7 @@
 #include "Suggestions.h"
 
+#include "Texts.h"
+
 #include "contacts/records/SearchText.h"
 
 #include <algorithm>
@@ -45,7 +47,8 @@ std::vector<std::string> suggestions(const std::string& written, const std::vect
             least = std::min(least, distance(wanted, std::string_view(name).substr(begin, end - begin), most));
             begin = end + 1;
         }
-        if (least <= most) near.emplace(least, candidate);
+        const bool isBegun = wanted.size() >= 2 && name.starts_with(wanted);
+        if (isBegun || least <= most) near.emplace(isBegun ? 0 : least, candidate);
         if (near.size() > kMost) near.erase(std::prev(near.end()));
     }
     std::vector<std::string> all;
@@ -55,10 +58,10 @@ std::vector<std::string> suggestions(const std::string& written, const std::vect
 
 std::string didYouMean(const std::vector<std::string>& suggested) {
     if (suggested.empty()) return "";
-    std::string text = " Did you mean ";
+    std::string names;
     for (size_t i = 0; i < suggested.size(); ++i)
-        text += (i == 0 ? "\"" : i + 1 == suggested.size() ? " or \"" : ", \"") + suggested[i] + "\"";
-    return text + "?";
+        names += (i == 0 ? "\"" : i + 1 == suggested.size() ? translated(" or \"") : ", \"") + suggested[i] + "\"";
+    return tr(" Did you mean {}?", names);
 }
 
 } // namespace rolvane::cli

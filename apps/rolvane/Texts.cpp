@@ -104,4 +104,14 @@ std::string shownDate(const std::string& text) {
     return date ? shownDate(*date) : text;
 }
 
+std::string shownDay(const std::string& day) {
+    const auto date = language().writesDates ? Date::fromISO8601(day + "T00:00:00Z") : std::nullopt;
+    if (!date) return day;
+    const auto seconds = static_cast<time_t>(date->secondsSince1970());
+    tm parts{};
+    std::array<char, 200> text{};
+    if (!::gmtime_r(&seconds, &parts)) return day;
+    return std::strftime(text.data(), text.size(), "%x", &parts) > 0 ? text.data() : day;
+}
+
 } // namespace rolvane::cli

@@ -16,6 +16,11 @@ void useLanguageOfThePerson();
 // The text in that language; itself where the catalog has none. The pointer lives as long as the process.
 const char* translated(const char* text);
 
+// Marks a text for the catalogs that is looked up elsewhere.
+constexpr const char* marked(const char* text) {
+    return text;
+}
+
 // fmt::format with the text in that language. A translation may name its places ("{1} of {0}").
 template <class... Arguments>
 std::string tr(fmt::format_string<Arguments...> text, Arguments&&... arguments) {
@@ -32,5 +37,8 @@ std::string shownNumber(unsigned long long number);
 std::string shownDate(const Date& date);
 // The same of a text as programs get it ("2026-11-21T01:44:09Z"); what is no such text stays.
 std::string shownDate(const std::string& text);
+
+// A day ("1980-12-31") as the language writes it; no time zone moves it.
+std::string shownDay(const std::string& day);
 
 } // namespace rolvane::cli

@@ -1,6 +1,5 @@
 #include "Consent.h"
 #include "Context.h"
-#include "Counted.h"
 #include "ImportReport.h"
 #include "Texts.h"
 #include "ValueNames.h"
@@ -25,18 +24,16 @@ WithdrawnContacts findWithdrawn(const std::string& named) {
     }
     if (found.size() == 1) return found.front();
     if (found.empty())
-        throw CommandError(kNotFound,
-                           fmt::format("Nothing is kept of \"{}\". `rolvane withdrawn list` lists what is.", named));
+        throw CommandError(kNotFound, tr("Nothing is kept of \"{}\". `rolvane withdrawn list` lists what is.", named));
     std::string list;
     for (const WithdrawnContacts& record : found) list += "\n  " + record.name;
-    throw CommandError(kNotFound,
-                       fmt::format("\"{}\" withdrew {} times. Name one of them:{}", named, found.size(), list));
+    throw CommandError(kNotFound, tr("\"{}\" withdrew {} times. Name one of them:{}", named, found.size(), list));
 }
 
 void listWithdrawn(Context& context) {
     const Json all = withdrawnJson();
     if (context.json) return context.print(all);
-    if (all.empty()) context.say("Nobody has withdrawn contacts from you.");
+    if (all.empty()) context.say(translated("Nobody has withdrawn contacts from you."));
     for (const Json& record : all)
         context.line(fmt::format("{}  {}", record["name"].get<std::string>(), withdrawnText(record)));
 }
@@ -44,7 +41,7 @@ void listWithdrawn(Context& context) {
 void importWithdrawn(Context& context, const std::string& named) {
     const WithdrawnContacts record = findWithdrawn(named);
     if (record.file.empty())
-        throw CommandError(kNotFound, fmt::format("There was nothing to keep when {} withdrew.", record.user.str()));
+        throw CommandError(kNotFound, tr("There was nothing to keep when {} withdrew.", record.user.str()));
     reportImport(context, VCardImport::importFile(context.database(), record.file), 0);
 }
 
@@ -52,12 +49,12 @@ void forgetWithdrawn(Context& context, const std::string& named, bool yes) {
     const WithdrawnContacts record = findWithdrawn(named);
     if (!record.file.empty())
         requireConsent(context, yes,
-                       fmt::format("Delete what is kept of {}, {} and {}? There is no other copy here.",
-                                   record.user.str(), counted(record.people, "person", "people"),
-                                   counted(record.groups, "group", "groups")),
-                       "Nothing was deleted.");
+                       tr("Delete what is kept of {}, {} and {}? There is no other copy here.", record.user.str(),
+                          countedText(record.people, "person", "people"),
+                          countedText(record.groups, "group", "groups")),
+                       translated("Nothing was deleted."));
     WithdrawnContactsFolder().forget(record);
-    context.say(fmt::format("{} is forgotten, with {}.", record.name, counted(record.people, "person", "people")));
+    context.say(tr("{} is forgotten, with {}.", record.name, countedText(record.people, "person", "people")));
 }
 
 } // namespace
@@ -77,10 +74,9 @@ Json withdrawnJson() {
 
 std::string withdrawnText(const Json& record) {
     const size_t people = record["people"], groups = record["groups"];
-    return fmt::format("{}'s, {} and {}, on {}{}", record["user"].get<std::string>(),
-                       counted(people, "person", "people"), counted(groups, "group", "groups"),
-                       shownDate(record["date"].get<std::string>()),
-                       record["file"].is_null() ? "" : ", kept in " + record["file"].get<std::string>());
+    return tr("{}'s, {} and {}, on {}{}", record["user"].get<std::string>(), countedText(people, "person", "people"),
+              countedText(groups, "group", "groups"), shownDate(record["date"].get<std::string>()),
+              record["file"].is_null() ? "" : tr(", kept in {}", record["file"].get<std::string>()));
 }
 
 void addWithdrawnCommands(CLI::App& app, Context& context) {

@@ -4,6 +4,7 @@
 #include "Computers.h"
 #include "Context.h"
 #include "HelpCommand.h"
+#include "HelpFormatter.h"
 #include "LogCommands.h"
 #include "ManualCommand.h"
 #include "PlanCommand.h"
@@ -11,6 +12,7 @@
 #include "SeeingCommands.h"
 #include "SetupCommands.h"
 #include "Suggestions.h"
+#include "Terminal.h"
 #include "Texts.h"
 
 #include "contacts/database/DaemonMemory.h"
@@ -18,14 +20,12 @@
 
 #include <algorithm>
 #include <iostream>
+#include <unistd.h>
 
 namespace {
 
-constexpr const char* kFooter =
-    R"(Data goes to standard output, messages to standard error. `rolvane COMMAND --help` tells more.
-
-Examples:
-  rolvane import friends.vcf
+constexpr const char* kExamples =
+    R"(  rolvane import friends.vcf
   rolvane setup
   rolvane setup 'rolvane:1:...'
   rolvane publish && rolvane watch
@@ -70,11 +70,21 @@ int endWith(const CLI::App& app, const CLI::ParseError& error, int argc, char** 
     }
     const auto [command, unknown] = namedCommand(app, argc, argv);
     std::string what =
-        unknown.empty() ? error.what() : "There is no command \"" + nameOf(*command) + " " + unknown + "\"";
+        unknown.empty() ? error.what() : tr("There is no command \"{}\"", nameOf(*command) + " " + unknown);
     if (what.ends_with('.')) what.pop_back();
-    std::cerr << shownText("rolvane: " + what + "." + didYouMean(suggestions(unknown, namesBelow(*command))) + " `" +
-                           nameOf(*command) + " --help` shows what can be given.\n");
+    std::cerr << shownText("rolvane: " + what + "." + didYouMean(suggestions(unknown, namesBelow(*command))) +
+                           tr(" `{} --help` shows what can be given.", nameOf(*command)) + "\n");
     return kUsage;
+}
+
+// The words of the library that writes the help.
+void translateHeadings(CLI::App& app) {
+    using rolvane::cli::marked;
+    using rolvane::cli::translated;
+    for (const char* word : {marked("Usage"), marked("OPTIONS"), marked("SUBCOMMAND"), marked("SUBCOMMANDS"),
+                             marked("Positionals"), marked("REQUIRED"), marked("Needs"), marked("Excludes")})
+        app.get_formatter()->label(word, translated(word));
+    app.set_help_flag("-h,--help", translated("Print this help message and exit"));
 }
 
 // Documents, candidates of the shells and manual pages are for programs: the same in every language.
@@ -93,13 +103,20 @@ int main(int argc, char** argv) {
     if (isForAPerson(argc, argv)) useLanguageOfThePerson();
     CLI::App app(translated("Rolvane shares parts of your contacts with other people and keeps every copy in step."),
                  "rolvane");
+    app.formatter(std::make_shared<HelpFormatter>(terminalColumns(STDOUT_FILENO)));
+    translateHeadings(app);
     Context context;
-    app.footer(exitCodeLines() + "\n" + kFooter);
-    app.set_version_flag("--version", "rolvane " ROLVANE_VERSION);
+    app.footer(exitCodeLines() + "\n" +
+               translated("Data goes to standard output, messages to standard error. `rolvane COMMAND --help` tells "
+                          "more.") +
+               "\n\n" + translated("Examples:") + "\n" + kExamples);
+    app.set_version_flag("--version", "rolvane " ROLVANE_VERSION,
+                         translated("Display program version information and exit"));
     app.require_subcommand(1);
     app.fallthrough();
     app.add_flag("--json", context.json, "Print data as one JSON document");
     app.add_flag("-q,--quiet", context.quiet, "No messages but errors");
+    translateOptions(app);
     addContactCommands(app, context);
     addDuplicateCommands(app, context);
     addGroupCommands(app, context);
@@ -133,7 +150,9 @@ int main(int argc, char** argv) {
         app.parse(argc, argv);
         std::cout.flush();
         if (!std::cout) {
-            std::cerr << "rolvane: standard output could not be written. Is the disk full, or the reader gone?\n";
+            std::cerr << "rolvane: "
+                      << translated("standard output could not be written. Is the disk full, or the reader gone?")
+                      << "\n";
             return kFailed;
         }
         return context.exitCode;

@@ -25,10 +25,10 @@ protected:
 };
 
 TEST_F(Account, WithoutOneEveryCommandThatNeedsItSaysSo) {
-    EXPECT_TRUE(saysOnce(world.rolvane({"account", "show"}), kNoSuchThing, "rolvane account set"));
-    EXPECT_TRUE(saysOnce(test(), kNoSuchThing, "rolvane account set"));
-    EXPECT_TRUE(saysOnce(world.rolvane({"publish"}), kNoSuchThing, "rolvane account set"));
-    EXPECT_TRUE(saysOnce(world.rolvane({"unpublish", "--yes"}), kNoSuchThing, "rolvane account set"));
+    EXPECT_TRUE(saysOnce(world.rolvane({"account", "show"}), kNoSuchThing, "rolvane setup"));
+    EXPECT_TRUE(saysOnce(test(), kNoSuchThing, "rolvane setup"));
+    EXPECT_TRUE(saysOnce(world.rolvane({"publish"}), kNoSuchThing, "rolvane setup"));
+    EXPECT_TRUE(saysOnce(world.rolvane({"unpublish", "--yes"}), kNoSuchThing, "rolvane setup"));
     EXPECT_TRUE(saysOnce(set({"--endpoint", "https://dav.example.org/{user}/Contacts"}), kWrongLine, "--user"));
 }
 
