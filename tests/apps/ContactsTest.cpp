@@ -269,6 +269,13 @@ TEST_F(Contacts, ABirthdayWithoutItsYearIsShownAsADay) {
     EXPECT_NE(world.done({"show", "Ada"}).find("17 May"), std::string::npos);
 }
 
+TEST_F(Contacts, ABirthdayIsADayInACardToo) {
+    world.add("Ada", {"--birthday", "1980-12-31"});
+    const Ran ran = world.rolvane({"export"});
+    EXPECT_NE(ran.output.find("\nBDAY:19801231\r\n"), std::string::npos) << ran;
+    EXPECT_EQ(ran.errors, "1 card written.\n");
+}
+
 TEST_F(Contacts, PeopleWhoAreOneAreListedAndJoinedAndATrialJoinsNobody) {
     const std::string one = world.add("Ada", {"--email", "home:ada@b.test", "--title", "Cook"});
     const std::string two = world.add("Ada", {"--email", "work:ada@b.test", "--title", "Baker"});

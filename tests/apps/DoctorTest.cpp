@@ -7,6 +7,7 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <unistd.h>
 
 namespace rolvane::test {
 namespace {
@@ -111,6 +112,78 @@ TEST_F(TheDoctor, NamesAnotherComputerThatHasPublished) {
     text[serial] = text[serial] == 'A' ? 'B' : 'A';
     std::ofstream(info) << text;
     expectFailed(examine(kFailure), "computers", "rolvane status");
+}
+
+// Whoever reads others' contacts and publishes nothing may have a tree on the store all the same: an empty one.
+TEST_F(TheDoctor, TellsAReaderWhoPublishesNothingOfNoOtherComputer) {
+    world.makeAccount();
+    world.add("Ada");
+    world.done({"publish"});
+    Neighbour bob(world, "bob");
+    world.done({"share", "bob"});
+    bob.done({"subscribe", "alice"});
+    std::filesystem::create_directories(world.store().userDirectory("bob") + "/Contacts");
+    bob.done({"daemon", "restart"});
+    bob.done({"sync"});
+    const auto told = of(bob.json({"doctor"}), "computers");
+    EXPECT_EQ(told["what"], "Nothing of this account is published yet.") << told.dump(2);
+    EXPECT_EQ(told["state"], "well");
+}
+
+// One failure is told once, with the command that goes on; what needs the preferences is not known.
+TEST_F(TheDoctor, NamesDamagedPreferences) {
+    world.add("Ada");
+    ASSERT_EQ(world.rolvane({"defaults", "write", "Key", "word"}).status, kDone);
+    const std::string file = world.home / "state/rolvane/preferences.db";
+    for (const char* suffix : {"-wal", "-shm"}) std::filesystem::remove(file + suffix);
+    std::ofstream(file) << std::string(4096, 'x');
+    const auto told = examine(kFailure);
+    expectFailed(told, "preferences", "mv ");
+    for (const auto& finding : told["findings"])
+        EXPECT_TRUE(finding["state"] != "failed" || finding["check"] == "preferences") << finding.dump(2);
+    EXPECT_EQ(of(told, "queue")["state"], "unknown");
+    const std::string command = of(told, "preferences")["toDo"];
+    EXPECT_EQ(world.run({"sh", "-c", command}).status, 0);
+    EXPECT_EQ(examine()["well"], true) << "the command cures it";
+}
+
+// A store whose administrator has forbidden or switched off a method.
+std::vector<std::string> answering(const std::string& method, int status) {
+    return {"LoadModule rewrite_module /usr/lib/apache2/modules/mod_rewrite.so", "RewriteEngine On",
+            "RewriteCond %{REQUEST_METHOD} =" + method, "RewriteRule ^ - [R=" + std::to_string(status) + ",L]"};
+}
+
+TEST_F(TheDoctor, NamesAStoreThatLetsNobodyWrite) {
+    world.storeConfiguration = answering("PUT", 403);
+    world.makeAccount();
+    expectFailed(examine(kFailure), "rights", "rolvane account test");
+}
+
+TEST_F(TheDoctor, TellsOfAStoreWithoutLocks) {
+    world.storeConfiguration = answering("LOCK", 405);
+    world.makeAccount();
+    const auto told = examine();
+    EXPECT_EQ(of(told, "webdav")["state"], "note") << told.dump(2);
+    EXPECT_EQ(of(told, "webdav")["what"].get<std::string>().find("It keeps no locks"), 0U) << told.dump(2);
+}
+
+TEST_F(TheDoctor, NamesDirectoriesThatCannotBeWritten) {
+    world.add("Ada");
+    const std::filesystem::path data = world.home / "data/rolvane";
+    std::filesystem::permissions(data, std::filesystem::perms(0500));
+    std::vector<std::string> command;
+    if (::geteuid() == 0) command = {"setpriv", "--bounding-set=-all", "--inh-caps=-all"};
+    command.insert(command.end(), {UserWorld::rolvaneProgram(), "doctor", "--json"});
+    const Ran ran = world.run(command);
+    std::filesystem::permissions(data, std::filesystem::perms(0700));
+    EXPECT_EQ(ran.status, kFailure) << ran;
+    expectFailed(nlohmann::json::parse(ran.output), "disk", "ls -ld");
+}
+
+TEST_F(TheDoctor, SaysThatThereIsNoBus) {
+    EXPECT_EQ(of(examine(), "bus")["state"], "note");
+    world.bus();
+    EXPECT_EQ(of(examine(), "bus")["state"], "well");
 }
 
 TEST_F(TheDoctor, NamesADatabaseThatIsGone) {

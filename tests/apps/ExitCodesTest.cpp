@@ -1,5 +1,6 @@
 // Every command in every situation that has an exit code of its own (`rolvane help exit-codes`): without an account,
-// with a store that is away, with one that refuses the password, with a wrong line, and with a name that nobody has.
+// with a store that is away, with one that refuses the password, with a wrong line, and with a name that nobody has. In
+// pipes, at terminals of all widths, in three languages.
 
 #include "CommandWorld.h"
 #include "TerminalSession.h"
@@ -7,6 +8,7 @@
 #include "support/PseudoTerminal.h"
 
 #include <array>
+#include <filesystem>
 #include <regex>
 #include <set>
 #include <sstream>
@@ -158,27 +160,50 @@ TEST_F(ExitCodes, AreTheSameForEveryCommandWithoutAnAccount) {
     expectAll(&Row::none, "no account");
 }
 
-// With nobody who answers questions: what asks is refused.
-TEST_F(ExitCodes, AreTheSameForEveryCommandAtATerminalOfAnyWidthAndInAnotherLanguage) {
+// A terminal, or a pipe (0 columns), in a language, with or without the wish for no colours.
+struct Place {
+    unsigned short columns;
+    const char* language;
+    bool noColour;
+};
+
+class Places : public ExitCodes, public testing::WithParamInterface<Place> {};
+
+INSTANTIATE_TEST_SUITE_P(ExitCodes, Places,
+                         testing::Values(Place{0, "C", true}, Place{0, "de_DE.UTF-8", false}, Place{40, "C", true},
+                                         Place{40, "de_DE.UTF-8", true}, Place{60, "de_DE.UTF-8", false},
+                                         Place{80, "C", false}, Place{80, "de_DE.UTF-8", true}, Place{120, "C", true},
+                                         Place{200, "de_DE.UTF-8", true}),
+                         [](const auto& each) {
+                             return std::to_string(each.param.columns) +
+                                    (*each.param.language == 'C' ? "C" : "German") +
+                                    (each.param.noColour ? "NoColour" : "");
+                         });
+
+// With nobody who answers questions: what asks is refused. Lines of a terminal are never wider than it where a command
+// draws them itself: bars, lists.
+TEST_P(Places, HaveOneExitCodeForEachCommand) {
+    const Place& place = GetParam();
     std::vector<std::string> environment = world.home.environment();
     std::erase_if(environment, [](const std::string& each) { return each.starts_with("LANG="); });
-    for (const char* each : {"NO_COLOR=1", "TERM=xterm-256color", "LANG=de_DE.UTF-8"}) environment.emplace_back(each);
+    environment.emplace_back("TERM=xterm-256color");
+    environment.emplace_back(std::string("LANG=") + place.language);
+    if (place.noColour) environment.emplace_back("NO_COLOR=1");
     static const std::regex ended("<ended ([0-9]+)>"), colour("\x1B\\[[0-9;]*m");
-    constexpr std::array<unsigned short, 5> kWidths{40, 60, 80, 120, 200};
-    size_t width = 0;
     for (const Row& row : kRows) {
         if (row.none == kNotRun) continue;
         std::string command = UserWorld::rolvaneProgram();
         for (const std::string& word : words(row.line)) command += " " + quotedForShell(inPlace(word));
-        const unsigned short columns = kWidths[width++ % kWidths.size()];
-        PseudoTerminal terminal({"sh", "-c", command + " </dev/null; echo \"<ended $?>\""}, environment,
-                                {.columns = columns, .rows = 24});
+        const std::string pipe = place.columns == 0 ? " 2>&1 | cat" : "";
+        PseudoTerminal terminal({"bash", "-c", command + " </dev/null" + pipe + "; echo \"<ended ${PIPESTATUS[0]}>\""},
+                                environment, {.columns = place.columns, .rows = 24});
         const std::string shown = terminal.readToEnd();
         std::smatch found;
         ASSERT_TRUE(std::regex_search(shown, found, ended)) << row.line << ":\n" << shown;
-        EXPECT_EQ(std::stoi(found[1]), row.none) << "at " << columns << " columns: rolvane " << row.line << "\n"
-                                                 << shown;
-        EXPECT_FALSE(std::regex_search(shown, colour)) << row.line << "\n" << shown;
+        EXPECT_EQ(std::stoi(found[1]), row.none) << "rolvane " << row.line << "\n" << shown;
+        const bool mayHaveColours = place.columns > 0 && !place.noColour;
+        EXPECT_TRUE(mayHaveColours || !std::regex_search(shown, colour)) << row.line << "\n" << shown;
+        EXPECT_TRUE(place.columns > 0 || shown.find('\x1B') == std::string::npos) << row.line << "\n" << shown;
     }
 }
 
@@ -201,6 +226,103 @@ TEST_F(ExitCodes, AreTheSameForEveryCommandWithANameThatNobodyHas) {
             EXPECT_EQ(run(row.stranger, ran), kNoSuchThing) << "rolvane " << row.stranger << "\n" << ran;
         }
     }
+}
+
+// The German catalog with marks around each text, for a copy of the programs: what stands outside the marks is in no
+// catalog.
+class MarkedWords : public ExitCodes {
+protected:
+    MarkedWords() {
+        namespace fs = std::filesystem;
+        const std::string catalogs = world.home / "marked/share/locale/de/LC_MESSAGES";
+        fs::create_directories(catalogs);
+        fs::create_directories(world.home / "marked/bin");
+        for (const std::string& program : {UserWorld::rolvaneProgram(), UserWorld::managerProgram()})
+            fs::copy_file(program, world.home / "marked/bin" / fs::path(program).filename());
+        const Ran made = world.run({"sh", "-c",
+                                    "msgfilter --keep-header -i \"$1\" sed -z 's/^\\n*/&‹/; s/\\n*$/›&/' 2>/dev/null | "
+                                    "msgfmt -o \"$2/rolvane.mo\" -",
+                                    "sh", ROLVANE_SOURCE_DIR "/po/de.po", catalogs});
+        EXPECT_EQ(made.status, 0) << made;
+        world.home.setVariable("LANG", "de_DE.UTF-8");
+    }
+    // The text without what stands between marks, which may stand within one another.
+    static std::string outside(const std::string& text) {
+        static const std::string kBegin = "‹", kEnd = "›";
+        std::string found;
+        size_t depth = 0;
+        for (size_t i = 0; i < text.size(); ++i) {
+            const bool begins = text.compare(i, kBegin.size(), kBegin) == 0;
+            const bool ends = depth > 0 && text.compare(i, kEnd.size(), kEnd) == 0;
+            if (begins || ends) {
+                depth += begins ? 1 : -1;
+                i += kBegin.size() - 1;
+            } else if (depth == 0) {
+                found += text[i];
+            }
+        }
+        return found;
+    }
+    // Three words in a row, but for command lines.
+    void expectOnlyMarked(const std::string& line) {
+        std::vector<std::string> command{world.home / "marked/bin/rolvane"};
+        for (const std::string& word : words(line)) command.push_back(inPlace(word));
+        const Ran ran = world.run(command);
+        static const std::regex prose("[A-Za-z']{2,}[,;:.]? [A-Za-z']{2,}[,;:.]? [a-z']{2,}");
+        std::istringstream lines(outside(ran.output + "\n" + ran.errors));
+        for (std::string told; std::getline(lines, told);) {
+            if (told.starts_with("rolvane: ")) told.erase(0, 9);
+            const bool isKnown =
+                std::any_of(std::begin(kInTheirOwnWords), std::end(kInTheirOwnWords),
+                            [&](const char* each) { return std::regex_search(told, std::regex(each)); });
+            EXPECT_TRUE(isKnown || !std::regex_search(told, prose)) << "rolvane " << line << "\n" << told;
+        }
+    }
+    // Command lines, data, the library of the command line, and reasons that the rooms below give.
+    static constexpr const char* kInTheirOwnWords[] = {
+        "^:? *`?rolvane ",
+        "^ +--",            // the second line of an example
+        "cannot be read: ", // a card's file
+        "^The endpoint \"", // an account that cannot be
+        "^There is a contact database in ",
+        "No secure connection to ",
+    };
+};
+
+TEST_F(MarkedWords, AreAllThatACommandSays) {
+    for (const Row& row : kRows) {
+        if (row.none == kNotRun) continue;
+        expectOnlyMarked(row.line);
+        if (*row.stranger) expectOnlyMarked(row.stranger);
+    }
+}
+
+TEST_F(MarkedWords, AreAllThatACommandSaysWithAStore) {
+    publishAndRest();
+    world.store().addUser("bob", "a long and other word");
+    for (const char* line : {"publish", "share bob", "shares", "share bob --write", "preview bob", "who Ada", "plan",
+                             "status", "sync", "doctor", "account test", "account show", "computers", "unshare bob"})
+        expectOnlyMarked(line);
+    world.done({"daemon", "stop"});
+    world.store().stop(PrivateStore::Stop::atOnce);
+    for (const Row& row : kRows)
+        if (row.none != kNotRun) expectOnlyMarked(row.line);
+}
+
+TEST_F(MarkedWords, AreAllThatTheHelpSays) {
+    std::set<std::string> seen;
+    for (const Row& row : kRows) {
+        std::string command;
+        for (const std::string& word : words(row.line)) {
+            if (word.starts_with('-') || word.find_first_of("ABCDEFGHIJKLMNOPQRSTUVWXYZ/") != std::string::npos) break;
+            command += (command.empty() ? "" : " ") + word;
+            if (command == "help") break;
+            const Ran ran = world.run({world.home / "marked/bin/rolvane", "help", command});
+            if (ran.status == kDone || seen.insert(command).second) expectOnlyMarked("help " + command);
+        }
+    }
+    for (const char* topic : {"", "names", "output", "files", "exit-codes"})
+        expectOnlyMarked(std::string("help ") + topic);
 }
 
 // A command that is new has to be told here how it ends.

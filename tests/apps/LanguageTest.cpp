@@ -2,6 +2,7 @@
 // stay.
 
 #include "CommandWorld.h"
+#include "TerminalSession.h"
 
 #include "foundation/Date.h"
 
@@ -83,6 +84,35 @@ TEST_F(Language, OfDatesIsLocalTimeAsThePersonWritesIt) {
     speak("de_DE.UTF-8");
     EXPECT_THAT(world.done({"log"}),
                 HasSubstr(day.substr(8, 2) + "." + day.substr(5, 2) + "." + day.substr(0, 4) + " " + time));
+}
+
+TEST_F(Language, OfDaysIsAsThePersonWritesThemInContactsAndTheLog) {
+    world.add("Ada");
+    world.done({"edit", "Ada", "--birthday", "1980-12-31"});
+    speak("C");
+    EXPECT_THAT(world.done({"show", "Ada"}), HasSubstr("Birthday          1980-12-31\n"));
+    world.home.setVariable("TZ", "America/Los_Angeles"); // no zone moves a birthday
+    speak("de_DE.UTF-8");
+    EXPECT_THAT(world.done({"show", "Ada"}), HasSubstr("Geburtstag        31.12.1980\n"));
+    EXPECT_THAT(world.done({"log", "Ada"}), HasSubstr("Geburtstag: nichts -> 31.12.1980\n"));
+    EXPECT_EQ(world.json({"show", "Ada"})["properties"]["Birthday"], "1980-12-31T00:00:00Z");
+    speak("fr_FR.UTF-8");
+    EXPECT_THAT(world.done({"show", "Ada"}), HasSubstr("Anniversaire      31/12/1980\n"));
+}
+
+// A question shows the letters of the person's language, and takes those of English as well.
+TEST_F(Language, OfAnswersIsThePersons) {
+    speak("de_DE.UTF-8");
+    const auto answered = [&](const std::string& answer) {
+        world.add("Eve");
+        TerminalSession session(quotedForShell(UserWorld::rolvaneProgram()) + " delete Eve", world.home.environment());
+        EXPECT_TRUE(session.answer("[j/N] ", answer)) << session.shown();
+        return session.end();
+    };
+    EXPECT_EQ(answered("j"), kDone);
+    EXPECT_EQ(answered("Ja"), kDone);
+    EXPECT_EQ(answered("y"), kDone);
+    EXPECT_EQ(answered("nein"), kNotAllowed);
 }
 
 TEST_F(Language, OfNumbersSeparatesThousands) {

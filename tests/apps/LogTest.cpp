@@ -66,6 +66,25 @@ TEST_F(Log, AnImportAndAMergeAreOneChangeEach) {
     EXPECT_EQ(world.json({"list"}).size(), 2U);
 }
 
+TEST_F(Log, GoesBackOneChangeAfterTheOtherToTheFirst) {
+    world.add("Eve", {"--note", "one"});
+    world.done({"edit", "Eve", "--note", "two"});
+    world.done({"edit", "Eve", "--note", "three"});
+    world.done({"undo"});
+    EXPECT_EQ(world.json({"show", "Eve"})["properties"]["Note"], "two");
+    world.done({"undo"});
+    EXPECT_EQ(world.json({"show", "Eve"})["properties"]["Note"], "one");
+    world.done({"undo"});
+    EXPECT_TRUE(saysOnce(world.rolvane({"show", "Eve"}), kNoSuchThing, "There is no person"));
+}
+
+TEST_F(Log, ShowsValuesAsPeopleWriteThem) {
+    world.done({"edit", "Ada", "--birthday", "1980-12-31", "--address", "home:Main Street 5; 10115; Berlin"});
+    const std::string told = world.done({"log", "Ada"});
+    EXPECT_NE(told.find("Birthday: nothing -> 1980-12-31\n"), std::string::npos) << told;
+    EXPECT_NE(told.find("Home: Main Street 5, 10115, Berlin\n"), std::string::npos) << told;
+}
+
 TEST_F(Log, SaysWhatItCouldNotTakeBack) {
     world.done({"edit", "Ada", "--note", "first", "--nickname", "A"});
     const std::string change = std::to_string(last());

@@ -47,6 +47,11 @@ TEST_F(Searching, AMistypedCommandIsAnsweredWithNearOnes) {
     EXPECT_EQ(far.errors.find("Did you mean"), std::string::npos);
 }
 
+TEST_F(Searching, ABegunCommandIsAnsweredWithTheWholeOnes) {
+    EXPECT_TRUE(saysOnce(world.rolvane({"group", "ad"}), kWrongLine, "Did you mean \"add\" or \"add-group\"?"));
+    EXPECT_TRUE(saysOnce(world.rolvane({"stat"}), kWrongLine, "Did you mean \"status\"?"));
+}
+
 TEST_F(Searching, HelpTellsOfCommandsAndTopics) {
     EXPECT_EQ(world.done({"help", "group", "add"}), world.done({"group", "add", "--help"}));
     const std::string all = world.done({"help"});

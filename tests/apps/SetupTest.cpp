@@ -6,6 +6,7 @@
 #include "foundation/Paths.h"
 #include "store/account/CertificateChain.h"
 #include "store/account/Invitation.h"
+#include "support/PseudoTerminal.h"
 #include "support/WaitUntil.h"
 
 #include <filesystem>
@@ -50,6 +51,12 @@ TEST_F(SettingUp, WithOptionsAlonePutsEverythingInItsPlace) {
     ASSERT_EQ(::stat(world.json({"account", "show"})["password"]["value"].get<std::string>().c_str(), &info), 0);
     EXPECT_EQ(info.st_mode & 0777U, 0600U);
     EXPECT_FALSE(std::filesystem::exists(world.home / "config/rolvane/password.next"));
+}
+
+TEST_F(SettingUp, IsNamedToWhoeverHasNoAccount) {
+    EXPECT_NE(world.done({"status"}).find("no account yet (`rolvane setup`)"), std::string::npos);
+    EXPECT_TRUE(saysOnce(world.rolvane({"publish"}), kNoSuchThing,
+                         "There is no account on a store yet. `rolvane setup` makes one."));
 }
 
 TEST_F(SettingUp, TakesAnAuthorityByItsFingerprint) {
@@ -298,6 +305,22 @@ TEST_F(Inviting, ALineIsTheSameAsAQRCode) {
     const Ran ran = world.rolvane({"store", "user", "add", "bob", "--invite", "--qr", "--directory", directory()});
     ASSERT_EQ(ran.status, kDone) << ran;
     EXPECT_GT(lineCount(ran.output), 20U) << ran;
+}
+
+TEST_F(Inviting, AQRCodeHasNoColoursWhereNoneAreWantedAndSaysHowWideItIs) {
+    std::vector<std::string> environment = world.home.environment();
+    environment.emplace_back("NO_COLOR=1");
+    const auto shown = [&](const std::string& user, unsigned short columns) {
+        PseudoTerminal terminal(
+            {UserWorld::rolvaneProgram(), "store", "user", "add", user, "--invite", "--qr", "--directory", directory()},
+            environment, {.columns = columns, .rows = 24});
+        return terminal.readToEnd();
+    };
+    const std::string wide = shown("bob", 120), narrow = shown("carol", 40);
+    EXPECT_EQ(wide.find('\x1B'), std::string::npos) << wide;
+    EXPECT_EQ(wide.find("columns wide"), std::string::npos) << wide;
+    EXPECT_NE(narrow.find("The QR code is "), std::string::npos) << narrow;
+    EXPECT_NE(narrow.find("columns wide, and this terminal has 40"), std::string::npos) << narrow;
 }
 
 TEST(InvitationLine, IsReadWhateverMailProgramsMakeOfIt) {

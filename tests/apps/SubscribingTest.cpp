@@ -174,7 +174,8 @@ TEST_F(Subscribing, ACopyThatMayOnlyBeReadIsNotEditedDeletedOrRegrouped) {
                                                         {"group", "remove", "Family", "Ada Miller"},
                                                         {"add", "--first", "Another", "--group", "Family"}};
     for (const auto& command : refused)
-        EXPECT_TRUE(saysOnce(bob.rolvane(command), kNotAllowed, "may be read but not changed")) << command[0];
+        EXPECT_TRUE(saysOnce(bob.rolvane(command), kNotAllowed, "Ask alice for `rolvane share bob --write`."))
+            << command[0];
     EXPECT_EQ(bob.json({"list", "--full"}), before);
     EXPECT_EQ(bob.json({"group", "list"}), groups);
 }

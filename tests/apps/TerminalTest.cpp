@@ -5,7 +5,9 @@
 
 #include "support/PseudoTerminal.h"
 
+#include <algorithm>
 #include <regex>
+#include <sstream>
 
 namespace rolvane::test {
 namespace {
@@ -106,6 +108,28 @@ TEST_F(Terminals, AndPipesHaveTheSameExitCodesAndNoColours) {
             EXPECT_FALSE(std::regex_search(shown.text, colour)) << command << "\n" << shown.text;
         }
     }
+}
+
+// But for the command lines of examples, which are to be copied.
+TEST_F(Terminals, OfEveryWidthHaveRoomForTheHelp) {
+    for (const unsigned short columns : {40, 60, 80, 120})
+        for (const char* command : {"help", "help setup", "help books on", "publish --help"})
+            for (const char* language : {"C", "de_DE.UTF-8"}) {
+                const Shown shown = at(columns, language, command);
+                EXPECT_EQ(shown.status, kDone) << shown.text;
+                std::istringstream lines(shown.text);
+                for (std::string line; std::getline(lines, line);) {
+                    if (line.ends_with('\r')) line.pop_back();
+                    const size_t begin = std::min(line.find_first_not_of(' '), line.size());
+                    const bool isCommand = line.compare(begin, 8, "rolvane ") == 0;
+                    const bool isOneWord = line.find(' ', begin) == std::string::npos;
+                    const auto isBegin = [](char c) { return (static_cast<unsigned char>(c) & 0xC0U) != 0x80U; };
+                    const auto width = std::count_if(line.begin(), line.end(), isBegin);
+                    EXPECT_TRUE(isCommand || isOneWord || width <= columns)
+                        << columns << " columns, " << language << ", " << command << ":\n"
+                        << line;
+                }
+            }
 }
 
 // Whoever has set nothing up gets one answer from all commands that need it.
