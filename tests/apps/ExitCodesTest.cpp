@@ -285,6 +285,8 @@ protected:
         "cannot be read: ", // a card's file
         "^The endpoint \"", // an account that cannot be
         "^There is a contact database in ",
+        "^There is no store in ",
+        "^A store that root runs is restored by hand",
         "No secure connection to ",
     };
 };
