@@ -127,9 +127,9 @@ public:
     std::string errorLog() const;
     std::string baseURL() const;  // "https://localhost:PORT/dav"; throws before the first start
     std::string localURL() const; // the same, by this machine's own name
-    // What the store shows to clients: the certificate's PEM file. "" while ACME has not given one yet.
+    // The PEM file of the certificate that clients are shown. "" while ACME has not given one yet.
     std::string certificateFile() const;
-    // What a client has to trust, as SHA-256 of a certificate that the store shows; "" when the system's authorities
+    // SHA-256 of the shown certificate that a client has to trust; "" when the system's authorities
     // have signed for it. CXException while there is no certificate.
     std::string authorityFingerprint() const;
     std::string endpointTemplate() const; // baseURL() + "/{user}/Contacts"
