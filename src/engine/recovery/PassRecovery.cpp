@@ -36,8 +36,7 @@ void PassRecovery::begin(CXDChangeRecords& records, size_t fresh) {
     // Of a pass that was killed, or what an earlier one left adrift.
     _underWay = underWayInAnyForm(_parts.state.underWay());
     _unsettled = unsettledOfOthers(records, fresh);
-    const CXDChangeRecords before = restatement().restate(records, fresh);
-    _underWay = underWayTogether(*_underWay, listsUnderWay(before));
+    restatement().restate(records, fresh);
     settle(records);
 }
 

@@ -162,8 +162,8 @@ void Restatement::dropRemovalsOfWhatIsBack(CXDChangeRecords& records, size_t fre
     records.erase(std::remove_if(queue, records.end(), isBack), records.end());
 }
 
-CXDChangeRecords Restatement::compareGroups(CXDChangeRecords& records, size_t fresh) const {
-    if (isLeftOut("restated groups")) return {};
+void Restatement::compareGroups(CXDChangeRecords& records, size_t fresh) const {
+    if (isLeftOut("restated groups")) return;
     std::set<UniqueId> groups;
     for (size_t i = fresh; i < records.size(); ++i)
         if (isOfOwnGroup(*records[i])) groups.insert(cxUIDWithTableName(*records[i]->group(), kCXGroupTable));
@@ -174,15 +174,12 @@ CXDChangeRecords Restatement::compareGroups(CXDChangeRecords& records, size_t fr
         std::move(changes->begin(), changes->end(), std::back_inserter(now));
         return false;
     });
-    const auto queue = records.begin() + static_cast<std::ptrdiff_t>(fresh);
     const auto isRestated = [&](const CXDChangeRecordPtr& record) {
         return isOfOwnGroup(*record) && groups.contains(cxUIDWithTableName(*record->group(), kCXGroupTable));
     };
-    const auto restated = std::stable_partition(queue, records.end(), std::not_fn(isRestated));
-    CXDChangeRecords before(std::make_move_iterator(restated), std::make_move_iterator(records.end()));
-    records.erase(restated, records.end());
+    const auto queue = records.begin() + static_cast<std::ptrdiff_t>(fresh);
+    records.erase(std::remove_if(queue, records.end(), isRestated), records.end());
     std::move(now.begin(), now.end(), std::back_inserter(records));
-    return before;
 }
 
 void Restatement::dropWhatAWriterUndid(CXDChangeRecords& records, size_t fresh) const {
@@ -200,12 +197,12 @@ void Restatement::dropWhatAWriterUndid(CXDChangeRecords& records, size_t fresh) 
     std::erase(records, nullptr);
 }
 
-CXDChangeRecords Restatement::restate(CXDChangeRecords& records, size_t fresh) const {
-    if (records.size() <= fresh) return {};
+void Restatement::restate(CXDChangeRecords& records, size_t fresh) const {
+    if (records.size() <= fresh) return;
     withdrawWhatIsGone(records, fresh);
     dropRemovalsOfWhatIsBack(records, fresh);
     dropWhatAWriterUndid(records, fresh);
-    return compareGroups(records, fresh);
+    compareGroups(records, fresh);
 }
 
 } // namespace rolvane

@@ -27,9 +27,10 @@ struct Restatement {
     std::function<bool(const UserName& user)> hasCopies; // is the user's tree the one that the copies here came from?
 
     // `records`: the pass's input, `fresh` new ones and then the queue, which alone is looked at, and of it the changes
-    // in trees whose copies are here. Gives the changes of groups that gave way: some of them may be on the store,
-    // their answers lost. Main thread. Throws CXDamagedDatabase, and `records` may then be restated in part.
-    CXDChangeRecords restate(CXDChangeRecords& records, size_t fresh) const;
+    // in trees whose copies are here. Changes of groups that give way may be on the store, their answers lost: the note
+    // of what was under way still has them. Main thread. Throws CXDamagedDatabase, and `records` may then be restated
+    // in part.
+    void restate(CXDChangeRecords& records, size_t fresh) const;
     // The same but for the comparison of groups.
     void withdrawWhatIsGone(CXDChangeRecords& records, size_t fresh) const;
     void dropRemovalsOfWhatIsBack(CXDChangeRecords& records, size_t fresh) const;
@@ -38,7 +39,7 @@ struct Restatement {
 
 private:
     bool isCopyMadeAgain(const UniqueId& person) const; // by somebody at this computer
-    CXDChangeRecords compareGroups(CXDChangeRecords& records, size_t fresh) const;
+    void compareGroups(CXDChangeRecords& records, size_t fresh) const;
 };
 
 } // namespace rolvane

@@ -269,15 +269,6 @@ Dictionary underWay(const CXDChangeRecords& records) {
     return all;
 }
 
-Dictionary listsUnderWay(const CXDChangeRecords& records) {
-    const Dictionary all = underWay(records);
-    for (const auto& [user, of] : all) {
-        of.dictionary().remove(kPeople);
-        for (const auto& [group, touched] : of.dictionary()[kGroups].dictionary()) touched.dictionary().remove(kNames);
-    }
-    return all;
-}
-
 Dictionary underWayInAnyForm(const Dictionary& stored) {
     const Dictionary groups = stored[kGroups].dictionary();
     const bool isOfOneUser = stored[kPeople].isArray() ||

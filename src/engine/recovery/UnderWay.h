@@ -20,8 +20,6 @@ class CXRolvane;
 // {user: {"people": array, "subscription": text, "groups": {group: {"memberAdds": array, "memberRemoves",
 // "subgroupAdds", "subgroupRemoves", "names": likewise}}}}; empty when there is nothing to remember.
 Dictionary underWay(const CXDChangeRecords& records);
-// The same without people and names: of changes that have waited, nobody knows whether the store's name is the later.
-Dictionary listsUnderWay(const CXDChangeRecords& records);
 inline constexpr const char* kSubscription = "subscription"; // to the tree of somebody else; set by the caller
 // A note of an earlier version knew the own tree alone, and had no user in it.
 Dictionary underWayInAnyForm(const Dictionary& stored);
