@@ -36,3 +36,21 @@ function(rolvane_room name)
     target_link_libraries(rolvane_${name} INTERFACE ${ARG_ROOMS} ${ARG_PUBLIC} ${ARG_PRIVATE})
   endif()
 endfunction()
+
+# rolvane_paths(TARGET NAME="value" ...): defines each NAME for those sources of the target that mention it. On every
+# command line, a path of this directory would keep a compiler cache from knowing a source again in another clone. A
+# source that mentions one for the first time needs a new configuration.
+function(rolvane_paths target)
+  get_target_property(sources ${target} SOURCES)
+  list(FILTER sources EXCLUDE REGEX "^\\$<")
+  foreach(definition ${ARGN})
+    string(REGEX MATCH "^[A-Z_]+" name "${definition}")
+    foreach(source ${sources})
+      get_filename_component(path ${source} ABSOLUTE)
+      file(STRINGS ${path} mentions REGEX "${name}([^A-Z_]|$)" LIMIT_COUNT 1)
+      if(mentions)
+        set_property(SOURCE ${path} APPEND PROPERTY COMPILE_DEFINITIONS ${definition})
+      endif()
+    endforeach()
+  endforeach()
+endfunction()
