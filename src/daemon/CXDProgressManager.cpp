@@ -1,11 +1,12 @@
 #include "daemon/CXDProgressManager.h"
 
+#include "foundation/Mutex.h"
 #include "foundation/SignOfLife.h"
 
 namespace rolvane {
 
 void CXDProgressManager::setEngine(const RecordLocator* locator, const LocationOwner* owner) {
-    const std::lock_guard lock(_mutex);
+    const Lock lock(_mutex);
     _locator = locator;
     _owner = owner;
     _places.clear();
@@ -14,7 +15,7 @@ void CXDProgressManager::setEngine(const RecordLocator* locator, const LocationO
 void CXDProgressManager::startedPhase(int32_t phase) {
     bool first = false;
     {
-        const std::lock_guard lock(_mutex);
+        const Lock lock(_mutex);
         first = _currentPhase == 0;
         if (first) {
             _willProcessCounts.clear();
@@ -34,7 +35,7 @@ CXDProgressManager::Place& CXDProgressManager::placeOf(const CXDChangeRecord& re
 
 // A record without a remote location is counted nowhere.
 void CXDProgressManager::willProcessChangeRecord(const CXDChangeRecordPtr& record) {
-    const std::lock_guard lock(_mutex);
+    const Lock lock(_mutex);
     if (const auto& location = placeOf(*record).location) ++_willProcessCounts[*location];
 }
 
@@ -43,7 +44,7 @@ void CXDProgressManager::didProcessChangeRecord(const CXDChangeRecordPtr& record
     std::string shown;
     double progress = 0;
     {
-        const std::lock_guard lock(_mutex);
+        const Lock lock(_mutex);
         Place& place = placeOf(*record);
         if (!place.location) return;
         const auto announced = _willProcessCounts.find(*place.location);
@@ -66,7 +67,7 @@ void CXDProgressManager::stop() {
 }
 
 int32_t CXDProgressManager::currentPhase() const {
-    const std::lock_guard lock(_mutex);
+    const Lock lock(_mutex);
     return _currentPhase;
 }
 

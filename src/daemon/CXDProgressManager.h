@@ -2,12 +2,12 @@
 
 #include "acl/CXACLManager.h"
 #include "engine/EngineCollaborators.h"
+#include "foundation/Mutex.h"
 #include "foundation/Notification.h"
 #include "model/CXDChangeRecord.h"
 
 #include <cstdint>
 #include <map>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <tuple>
@@ -39,16 +39,16 @@ private:
         std::optional<RemoteLocation> location;
         std::optional<std::string> shown;
     };
-    Place& placeOf(const CXDChangeRecord& record); // with _mutex held
+    Place& placeOf(const CXDChangeRecord& record) REQUIRES(_mutex);
 
     DistributedNotifications& _notifications;
     const RecordLocator* _locator = nullptr;
     const LocationOwner* _owner = nullptr;
-    mutable std::mutex _mutex;
-    int32_t _currentPhase = 0;
-    std::map<Origin, Place> _places;
-    std::map<RemoteLocation, int64_t> _willProcessCounts;
-    std::map<RemoteLocation, int64_t> _didProcessCounts;
+    mutable Mutex _mutex;
+    int32_t _currentPhase GUARDED_BY(_mutex) = 0;
+    std::map<Origin, Place> _places GUARDED_BY(_mutex);
+    std::map<RemoteLocation, int64_t> _willProcessCounts GUARDED_BY(_mutex);
+    std::map<RemoteLocation, int64_t> _didProcessCounts GUARDED_BY(_mutex);
 };
 
 } // namespace rolvane

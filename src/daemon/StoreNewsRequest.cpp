@@ -1,7 +1,8 @@
 #include "daemon/StoreNewsRequest.h"
 
+#include "foundation/Mutex.h"
+
 #include <deque>
-#include <mutex>
 #include <new>
 #include <sys/eventfd.h>
 #include <unistd.h>
@@ -17,21 +18,30 @@ struct StoreNewsRequest::Inbox {
     Inbox(const Inbox&) = delete;
     Inbox& operator=(const Inbox&) = delete;
 
-    template <class Change>
-    void put(Change change) {
+    void put(NewsLine line) {
         {
-            const std::lock_guard guard(mutex);
-            change();
+            const Lock guard(mutex);
+            lines.push_back(std::move(line));
         }
+        ring();
+    }
+    void put(NewsEnd last) {
+        {
+            const Lock guard(mutex);
+            end = std::move(last);
+        }
+        ring();
+    }
+    void ring() const {
         const uint64_t one = 1;
         [[maybe_unused]] const ssize_t written = ::write(event, &one, sizeof one);
     }
 
     const int event = ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK); // readable: there is something
     bool ended = false;                                         // the object has gone; the loop's thread
-    std::mutex mutex;                                           // guards the following
-    std::deque<NewsLine> lines;
-    std::optional<NewsEnd> end;
+    Mutex mutex;
+    std::deque<NewsLine> lines GUARDED_BY(mutex);
+    std::optional<NewsEnd> end GUARDED_BY(mutex);
 };
 
 StoreNewsRequest::StoreNewsRequest(NewsWatch::Listener listener)
@@ -46,8 +56,8 @@ std::unique_ptr<NewsWatch::Request> StoreNewsRequest::open(RunLoop& loop, CXDAVM
                                                            NewsWatch::Listener listener, StoreNews::Limits limits) {
     std::unique_ptr<StoreNewsRequest> request(new StoreNewsRequest(std::move(listener)));
     const auto inbox = request->_inbox;
-    StoreNews::Listener fill{[inbox](NewsLine line) { inbox->put([&] { inbox->lines.push_back(std::move(line)); }); },
-                             [inbox](NewsEnd end) { inbox->put([&] { inbox->end = std::move(end); }); }};
+    StoreNews::Listener fill{[inbox](NewsLine line) { inbox->put(std::move(line)); },
+                             [inbox](NewsEnd end) { inbox->put(std::move(end)); }};
     request->_news = StoreNews::wait(client, trees, position, std::move(fill), limits);
     if (!request->_news) return nullptr;
     request->_port = loop.addPort(inbox->event, [made = request.get()](uint32_t) { made->tell(); });
@@ -63,7 +73,7 @@ void StoreNewsRequest::tell() {
     std::deque<NewsLine> lines;
     std::optional<NewsEnd> end;
     {
-        const std::lock_guard guard(inbox->mutex);
+        const Lock guard(inbox->mutex);
         lines.swap(inbox->lines);
         end.swap(inbox->end);
     }

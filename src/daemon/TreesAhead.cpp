@@ -2,6 +2,7 @@
 
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "foundation/Mutex.h"
 #include "store/dav/CXDAVManager.h"
 #include "store/reads/ListingMemory.h"
 
@@ -50,7 +51,7 @@ void TreesAhead::list(const std::vector<Url>& trees) {
         }
     }
     {
-        const std::lock_guard guard(_mutex);
+        const Lock guard(_mutex);
         _listed = std::move(listed);
     }
     const uint64_t one = 1;
@@ -62,7 +63,7 @@ void TreesAhead::take() {
     [[maybe_unused]] const ssize_t got = ::read(_event, &count, sizeof count);
     std::optional<Listed> listed;
     {
-        const std::lock_guard guard(_mutex);
+        const Lock guard(_mutex);
         listed.swap(_listed);
     }
     if (!listed) return;

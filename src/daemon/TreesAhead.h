@@ -1,11 +1,11 @@
 #pragma once
 
+#include "foundation/Mutex.h"
 #include "foundation/RunLoop.h"
 #include "foundation/Url.h"
 
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <set>
 #include <string>
@@ -42,8 +42,8 @@ private:
     std::set<std::string> _useless; // trees whose listings could not be kept
     std::function<void()> _done;
     std::thread _thread;
-    std::mutex _mutex;
-    std::optional<Listed> _listed; // guarded by _mutex
+    Mutex _mutex;
+    std::optional<Listed> _listed GUARDED_BY(_mutex);
     RunLoop::Handle _port;
 };
 

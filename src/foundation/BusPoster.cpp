@@ -2,6 +2,7 @@
 
 #include "foundation/DeliveryQueue.h"
 #include "foundation/Log.h"
+#include "foundation/Mutex.h"
 #include "foundation/NotificationMessage.h"
 
 #include <cstring>
@@ -83,7 +84,7 @@ void BusPoster::settle() {
 
 bool BusPoster::post(const Notification& notification) {
     requireNotificationName(notification.name);
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     for (int attempt = 0; attempt < 2; ++attempt) {
         if (!ready() && !connect()) return false;
         int result = send(notification);
@@ -102,12 +103,12 @@ bool BusPoster::post(const Notification& notification) {
 }
 
 bool BusPoster::connected() {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     return pump();
 }
 
 bool BusPoster::writeQueued() {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     eventfd_t ignored;
     ::eventfd_read(_queuedDescriptor, &ignored);
     if (!pump()) return true;

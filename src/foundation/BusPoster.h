@@ -1,9 +1,8 @@
 #pragma once
 
 #include "foundation/BusConnection.h"
+#include "foundation/Mutex.h"
 #include "foundation/Notification.h"
-
-#include <mutex>
 
 namespace rolvane {
 
@@ -26,18 +25,18 @@ public:
     bool writeQueued(); // true when nothing is queued any more
 
 private:
-    bool connect();
-    bool pump();
-    bool ready();
-    int send(const Notification& notification);
-    void settle();
+    bool connect() REQUIRES(_mutex);
+    bool pump() REQUIRES(_mutex);
+    bool ready() REQUIRES(_mutex);
+    int send(const Notification& notification) REQUIRES(_mutex);
+    void settle() REQUIRES(_mutex);
 
     const std::optional<std::string> _address;
     int _queuedDescriptor;
-    std::mutex _mutex; // of everything below
-    Bus _bus;
-    std::chrono::steady_clock::time_point _nextAttempt{}, _nextPump{};
-    bool _stalled = false; // the bus takes nothing; nobody waits for it until it does again
+    Mutex _mutex;
+    Bus _bus GUARDED_BY(_mutex);
+    std::chrono::steady_clock::time_point _nextAttempt GUARDED_BY(_mutex){}, _nextPump GUARDED_BY(_mutex){};
+    bool _stalled GUARDED_BY(_mutex) = false; // the bus takes nothing; nobody waits for it until it does again
 };
 
 } // namespace rolvane

@@ -1,5 +1,7 @@
 #include "foundation/ConditionLock.h"
 
+#include "foundation/Mutex.h"
+
 #include <algorithm>
 #include <chrono>
 #include <cmath>
@@ -22,7 +24,7 @@ std::chrono::steady_clock::time_point deadlineAfter(double seconds) {
 ConditionLock::ConditionLock(int condition) : _condition(condition) {}
 
 int ConditionLock::condition() const {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     return _condition;
 }
 
@@ -43,28 +45,29 @@ private:
 };
 
 void ConditionLock::lock() {
-    std::unique_lock guard(_mutex);
+    Lock guard(_mutex);
     if (_held) {
         Queued queued(*this, std::nullopt);
-        queued.waiter.wake.wait(guard, [&] { return !_held; });
+        queued.waiter.wake.wait(guard, [&]() REQUIRES(_mutex) { return !_held; });
     }
     _held = true;
 }
 
 void ConditionLock::lockWhenCondition(int condition) {
-    std::unique_lock guard(_mutex);
+    Lock guard(_mutex);
     if (!isFreeFor(condition)) {
         Queued queued(*this, condition);
-        queued.waiter.wake.wait(guard, [&] { return isFreeFor(condition); });
+        queued.waiter.wake.wait(guard, [&]() REQUIRES(_mutex) { return isFreeFor(condition); });
     }
     _held = true;
 }
 
 bool ConditionLock::lockWhenCondition(int condition, double timeoutSeconds) {
-    std::unique_lock guard(_mutex);
+    Lock guard(_mutex);
     if (!isFreeFor(condition)) {
         Queued queued(*this, condition);
-        if (!queued.waiter.wake.wait_until(guard, deadlineAfter(timeoutSeconds), [&] { return isFreeFor(condition); }))
+        if (!queued.waiter.wake.wait_until(guard, deadlineAfter(timeoutSeconds),
+                                           [&]() REQUIRES(_mutex) { return isFreeFor(condition); }))
             return false;
     }
     _held = true;
@@ -83,12 +86,12 @@ void ConditionLock::release() {
 }
 
 void ConditionLock::unlock() {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     release();
 }
 
 void ConditionLock::unlockWithCondition(int condition) {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     _condition = condition;
     release();
 }

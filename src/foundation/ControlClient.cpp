@@ -2,6 +2,7 @@
 
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "foundation/Mutex.h"
 
 #include <algorithm>
 #include <cerrno>
@@ -42,15 +43,13 @@ ControlClient::~ControlClient() {
 }
 
 bool ControlClient::connected() const {
-    const std::lock_guard guard(_mutex);
+    const RecursiveLock guard(_mutex);
     return static_cast<bool>(_socket);
 }
 
 bool ControlClient::connect() {
-    {
-        const std::lock_guard guard(_mutex);
-        if (!connectLocked()) return false;
-    }
+    const RecursiveLock guard(_mutex);
+    if (!connectLocked()) return false;
     if (!_port) _port = _loop.addPort(_socket.get(), [this](uint32_t) { read(); });
     return true;
 }
@@ -70,7 +69,7 @@ bool ControlClient::connectLocked() {
 
 void ControlClient::observe(std::vector<std::string> names) {
     {
-        const std::lock_guard guard(_mutex);
+        const RecursiveLock guard(_mutex);
         if (names == _names) return;
         _names = std::move(names);
         ControlMessage message;
@@ -83,7 +82,7 @@ void ControlClient::observe(std::vector<std::string> names) {
 
 void ControlClient::lookLater() {
     {
-        const std::lock_guard guard(_mutex);
+        const RecursiveLock guard(_mutex);
         if (_names.empty() || _look) return;
     }
     _look = _loop.scheduleTimer(kLookAgain, [this] {
@@ -93,7 +92,7 @@ void ControlClient::lookLater() {
 }
 
 bool ControlClient::send(ControlMessage message) {
-    const std::lock_guard guard(_mutex);
+    const RecursiveLock guard(_mutex);
     const std::string frame = message.frame();
     // A daemon that was started anew meanwhile is met at the second attempt.
     for (int attempt = 0; attempt < 2; ++attempt) {
@@ -144,9 +143,14 @@ std::optional<bool> ControlClient::heard(int64_t number) const {
 
 void ControlClient::read() {
     char bytes[16384];
+    int socket = -1;
+    {
+        const RecursiveLock guard(_mutex);
+        socket = _socket.get();
+    }
     try {
         for (;;) {
-            const ssize_t n = ::recv(_socket.get(), bytes, sizeof bytes, MSG_DONTWAIT);
+            const ssize_t n = ::recv(socket, bytes, sizeof bytes, MSG_DONTWAIT);
             if (n < 0 && errno == EINTR) continue;
             if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) return;
             if (n <= 0) return lost();
@@ -166,7 +170,7 @@ void ControlClient::read() {
 
 void ControlClient::lost() {
     {
-        const std::lock_guard guard(_mutex);
+        const RecursiveLock guard(_mutex);
         _port.reset();
         _socket = OwnedDescriptor();
         _reader = ControlReader();

@@ -2,11 +2,11 @@
 
 #include "foundation/ControlMessage.h"
 #include "foundation/ControlSocket.h"
+#include "foundation/Mutex.h"
 #include "foundation/RunLoop.h"
 
 #include <functional>
 #include <map>
-#include <mutex>
 #include <optional>
 
 namespace rolvane {
@@ -37,7 +37,7 @@ public:
     std::optional<bool> heard(int64_t number) const;
 
 private:
-    bool connectLocked();
+    bool connectLocked() REQUIRES(_mutex);
     bool send(ControlMessage message);
     std::optional<int64_t> sendForAnswer(ControlMessage message);
     void watchSoon();
@@ -48,9 +48,9 @@ private:
     RunLoop& _loop;
     const Finder _find;
     const std::function<void(Notification)> _arrived;
-    mutable std::recursive_mutex _mutex; // of the socket and the names
-    OwnedDescriptor _socket;
-    std::vector<std::string> _names;
+    mutable RecursiveMutex _mutex;
+    OwnedDescriptor _socket GUARDED_BY(_mutex);
+    std::vector<std::string> _names GUARDED_BY(_mutex);
     ControlReader _reader;
     std::map<int64_t, bool> _heard;
     int64_t _lastNumber = 0;

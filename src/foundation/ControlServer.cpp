@@ -2,6 +2,7 @@
 
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "foundation/Mutex.h"
 
 #include <algorithm>
 #include <cerrno>
@@ -25,7 +26,7 @@ ControlServer::ControlServer(std::string path, Callbacks callbacks)
 
 ControlServer::~ControlServer() {
     {
-        const std::lock_guard guard(_mutex);
+        const Lock guard(_mutex);
         _ended = true;
     }
     wake();
@@ -42,7 +43,7 @@ void ControlServer::wake() const {
 }
 
 bool ControlServer::post(const Notification& notification) {
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     std::string bytes;
     bool rest = false;
     for (auto& [fd, peer] : _peers) {
@@ -88,7 +89,7 @@ void ControlServer::serve() {
         std::vector<pollfd> ready{{_woken.get(), POLLIN, 0},
                                   {_listening.get(), static_cast<short>(crowded ? 0 : POLLIN), 0}};
         {
-            const std::lock_guard guard(_mutex);
+            const Lock guard(_mutex);
             if (_ended) return;
             std::erase_if(_peers, [](const auto& entry) { return entry.second.gone; });
             for (const auto& [fd, peer] : _peers)
@@ -101,7 +102,7 @@ void ControlServer::serve() {
         ::eventfd_read(_woken.get(), &ignored);
         for (size_t i = 2; i < ready.size(); ++i) {
             if (!ready[i].revents) continue;
-            std::unique_lock lock(_mutex);
+            Lock lock(_mutex);
             Peer& peer = _peers.at(ready[i].fd); // only this thread takes peers out
             if (ready[i].revents & POLLOUT) flush(peer);
             lock.unlock();
@@ -124,7 +125,7 @@ bool ControlServer::accept() {
             if (errno == EINTR || errno == ECONNABORTED) continue;
             return errno != EMFILE && errno != ENFILE;
         }
-        const std::lock_guard guard(_mutex);
+        const Lock guard(_mutex);
         const pid_t process = processOf(socket.get());
         if (!isOfThisUser(socket.get()) || !hasRoomFor(process)) continue;
         const int fd = socket.get();
@@ -153,7 +154,7 @@ void ControlServer::read(Peer& peer) {
         CXLog("A peer of the control socket is let go: %@", e.reason());
         ended = true;
     }
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     peer.gone = peer.gone || ended;
 }
 
@@ -168,7 +169,7 @@ void ControlServer::answer(Peer& peer, const ControlMessage& message) {
         heard.observed = _callbacks.observes(message.notification.name);
         _callbacks.arrived(message.notification);
     }
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     if (message.kind == Kind::observe) peer.observed = {message.names.begin(), message.names.end()};
     if (message.number != 0 && message.kind != Kind::heard) write(peer, heard.frame());
 }

@@ -2,10 +2,10 @@
 
 #include "foundation/ControlMessage.h"
 #include "foundation/ControlSocket.h"
+#include "foundation/Mutex.h"
 
 #include <functional>
 #include <map>
-#include <mutex>
 #include <set>
 #include <sys/types.h>
 #include <thread>
@@ -56,7 +56,7 @@ private:
     };
     void serve();
     bool accept(); // false when no descriptor is left for another peer
-    bool hasRoomFor(pid_t process) const;
+    bool hasRoomFor(pid_t process) const REQUIRES(_mutex);
     void read(Peer& peer);
     void answer(Peer& peer, const ControlMessage& message);
     static void write(Peer& peer, const std::string& bytes);
@@ -66,9 +66,9 @@ private:
     const std::string _path;
     const Callbacks _callbacks;
     OwnedDescriptor _listening, _woken;
-    std::mutex _mutex;
-    std::map<int, Peer> _peers; // guarded by _mutex, by their descriptor
-    bool _ended = false;        // guarded by _mutex
+    Mutex _mutex;
+    std::map<int, Peer> _peers GUARDED_BY(_mutex); // by their descriptor
+    bool _ended GUARDED_BY(_mutex) = false;
     std::thread _thread;
 };
 

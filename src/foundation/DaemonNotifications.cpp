@@ -2,6 +2,7 @@
 
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "foundation/Mutex.h"
 #include "foundation/Paths.h"
 
 #include <atomic>
@@ -45,7 +46,7 @@ void DaemonChannel::listen(const std::string& path) {
     ControlServer::Callbacks callbacks;
     callbacks.arrived = [this](const Notification& notification) { arrived(notification); };
     callbacks.observes = [this](const std::string& name) {
-        const std::lock_guard guard(_mutex);
+        const Lock guard(_mutex);
         return !_serving || _bus.delivery()->queue().observes(name);
     };
     callbacks.mayBeDropped = [](const std::string& name) { return name == kProgress; };
@@ -58,7 +59,7 @@ void DaemonChannel::listen(const std::string& path) {
 
 void DaemonChannel::arrived(const Notification& notification) {
     {
-        const std::lock_guard guard(_mutex);
+        const Lock guard(_mutex);
         if (!_serving) {
             if (_kept.size() < kMostKept) _kept.push_back(notification);
             return;
@@ -70,7 +71,7 @@ void DaemonChannel::arrived(const Notification& notification) {
 void DaemonChannel::serve() {
     std::vector<Notification> kept;
     {
-        const std::lock_guard guard(_mutex);
+        const Lock guard(_mutex);
         _serving = true;
         kept.swap(_kept);
     }

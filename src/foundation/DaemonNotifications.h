@@ -3,6 +3,7 @@
 #include "foundation/BusNotifications.h"
 #include "foundation/ControlClient.h"
 #include "foundation/ControlServer.h"
+#include "foundation/Mutex.h"
 
 namespace rolvane {
 
@@ -31,9 +32,9 @@ private:
     void arrived(const Notification& notification); // the server's thread
 
     BusNotifications _bus;
-    std::mutex _mutex;
-    bool _serving = false;           // guarded by _mutex
-    std::vector<Notification> _kept; // guarded by _mutex
+    Mutex _mutex;
+    bool _serving GUARDED_BY(_mutex) = false;
+    std::vector<Notification> _kept GUARDED_BY(_mutex);
     std::unique_ptr<ControlServer> _server;
 };
 

@@ -2,6 +2,7 @@
 
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "foundation/Mutex.h"
 
 #include <algorithm>
 #include <set>
@@ -38,7 +39,7 @@ std::shared_ptr<DeliveryQueue::Observer> DeliveryQueue::add(std::string name, No
     observer->name = std::move(name);
     observer->handler = std::move(handler);
     observer->coalesce = coalesce;
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     _observers.push_back(observer);
     return observer;
 }
@@ -46,7 +47,7 @@ std::shared_ptr<DeliveryQueue::Observer> DeliveryQueue::add(std::string name, No
 void DeliveryQueue::end(const std::shared_ptr<Observer>& observer) {
     observer->ended = true;
     std::list<Delivery> dropped; // destroyed without the lock
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     std::erase(_observers, observer);
     for (auto it = _waiting.begin(); it != _waiting.end();) {
         auto next = std::next(it);
@@ -57,12 +58,12 @@ void DeliveryQueue::end(const std::shared_ptr<Observer>& observer) {
 }
 
 bool DeliveryQueue::observes(const std::string& name) const {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     return std::any_of(_observers.begin(), _observers.end(), [&](const auto& o) { return o->name == name; });
 }
 
 std::vector<std::string> DeliveryQueue::names() const {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     std::set<std::string> all;
     for (const auto& observer : _observers) all.insert(observer->name);
     return {all.begin(), all.end()};
@@ -76,7 +77,7 @@ void DeliveryQueue::removeFirst() {
 void DeliveryQueue::arrive(const Notification& notification) {
     bool logOverflow = false;
     {
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         for (const auto& observer : _observers) {
             if (observer->name != notification.name) continue;
             if (observer->waiting) {
@@ -96,7 +97,7 @@ void DeliveryQueue::arrive(const Notification& notification) {
 }
 
 std::optional<DeliveryQueue::Delivery> DeliveryQueue::take() {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     if (_waiting.empty()) return {};
     auto delivery = std::move(_waiting.front());
     _waiting.pop_front();
@@ -105,7 +106,7 @@ std::optional<DeliveryQueue::Delivery> DeliveryQueue::take() {
 }
 
 bool DeliveryQueue::empty() const {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     return _waiting.empty();
 }
 

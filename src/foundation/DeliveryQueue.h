@@ -1,11 +1,11 @@
 #pragma once
 
+#include "foundation/Mutex.h"
 #include "foundation/Notification.h"
 
 #include <atomic>
 #include <list>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
@@ -44,12 +44,12 @@ public:
     bool empty() const;
 
 private:
-    void removeFirst();
+    void removeFirst() REQUIRES(_mutex);
 
-    mutable std::mutex _mutex;
-    std::vector<std::shared_ptr<Observer>> _observers; // in order of registration
-    std::list<Delivery> _waiting;
-    bool _overflowLogged = false;
+    mutable Mutex _mutex;
+    std::vector<std::shared_ptr<Observer>> _observers GUARDED_BY(_mutex); // in order of registration
+    std::list<Delivery> _waiting GUARDED_BY(_mutex);
+    bool _overflowLogged GUARDED_BY(_mutex) = false;
 };
 
 } // namespace rolvane

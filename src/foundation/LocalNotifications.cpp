@@ -1,6 +1,5 @@
 #include "foundation/DeliveryQueue.h"
-
-#include <mutex>
+#include "foundation/Mutex.h"
 
 namespace rolvane {
 
@@ -26,8 +25,8 @@ struct LocalNotifications::Impl {
 
     DeliveryQueue queue;
     std::atomic<bool> suspended{false};
-    mutable std::mutex mutex;
-    std::vector<Notification> posted;
+    mutable Mutex mutex;
+    std::vector<Notification> posted GUARDED_BY(mutex);
 };
 
 LocalNotifications::LocalNotifications() : _impl(std::make_shared<Impl>()) {}
@@ -40,7 +39,7 @@ bool LocalNotifications::post(const Notification& notification) {
                       Value(notification.userInfo).deepMutableCopy().dictionary()};
     auto impl = _impl;
     {
-        std::lock_guard guard(impl->mutex);
+        Lock guard(impl->mutex);
         impl->posted.push_back(sent);
     }
     impl->queue.arrive(sent);
@@ -60,12 +59,12 @@ void LocalNotifications::setSuspended(bool suspended) {
 }
 
 std::vector<Notification> LocalNotifications::posted() const {
-    std::lock_guard guard(_impl->mutex);
+    Lock guard(_impl->mutex);
     return _impl->posted;
 }
 
 void LocalNotifications::clear() {
-    std::lock_guard guard(_impl->mutex);
+    Lock guard(_impl->mutex);
     _impl->posted.clear();
 }
 

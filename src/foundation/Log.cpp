@@ -2,6 +2,7 @@
 
 #include "foundation/LogEvents.h"
 #include "foundation/LogSinks.h"
+#include "foundation/Mutex.h"
 
 #include <atomic>
 #include <charconv>
@@ -25,9 +26,9 @@ std::shared_ptr<LogSink> makePlatformSink() {
 }
 
 struct Sinks {
-    std::mutex mutex;
-    std::shared_ptr<LogSink> installed; // none: the platform's
-    std::shared_ptr<LogSink> platform;
+    Mutex mutex;
+    std::shared_ptr<LogSink> installed GUARDED_BY(mutex); // none: the platform's
+    std::shared_ptr<LogSink> platform GUARDED_BY(mutex);
 };
 
 // Never destroyed: lines may come from destructors that run at the end of the process.
@@ -101,13 +102,13 @@ std::string render(const Placeholder& p, std::string text) {
 } // namespace
 
 std::shared_ptr<LogSink> LogSink::install(std::shared_ptr<LogSink> sink) {
-    std::lock_guard guard(sinks().mutex);
+    Lock guard(sinks().mutex);
     std::swap(sinks().installed, sink);
     return sink;
 }
 
 std::shared_ptr<LogSink> LogSink::current() {
-    std::lock_guard guard(sinks().mutex);
+    Lock guard(sinks().mutex);
     if (sinks().installed) return sinks().installed;
     if (!sinks().platform) sinks().platform = makePlatformSink();
     return sinks().platform;

@@ -1,6 +1,7 @@
 #include "foundation/LogSinks.h"
 
 #include "foundation/Date.h"
+#include "foundation/Mutex.h"
 
 #include <cerrno>
 #include <cstdio>
@@ -74,7 +75,7 @@ void JournalSink::writeEvent(const LogEvent& event) {
 
 void StandardErrorSink::write(std::string_view line) {
     std::string text = standardErrorLine(line, program_invocation_short_name);
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     writeFully(STDERR_FILENO, text);
 }
 

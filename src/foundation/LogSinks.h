@@ -2,9 +2,9 @@
 
 #include "foundation/Log.h"
 #include "foundation/LogEvents.h"
+#include "foundation/Mutex.h"
 
 #include <memory>
-#include <mutex>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -38,7 +38,7 @@ public:
     void write(std::string_view line) override;
 
 private:
-    std::mutex _mutex;
+    Mutex _mutex;
 };
 
 } // namespace rolvane

@@ -1,6 +1,7 @@
 #include "foundation/LoopDelivery.h"
 
 #include "foundation/Log.h"
+#include "foundation/Mutex.h"
 
 #include <algorithm>
 
@@ -72,7 +73,7 @@ bool LoopDelivery::enqueue(Notification notification) {
     if (auto* id = notification.userInfo[kPostIdKey].stringIf()) {
         const std::string known = *id;
         notification.userInfo.remove(kPostIdKey);
-        const std::lock_guard guard(_seenMutex);
+        const Lock guard(_seenMutex);
         if (!_seen.isNew(known)) return false;
     }
     _queue.arrive(notification);

@@ -1,6 +1,7 @@
 #pragma once
 
 #include "foundation/DeliveryQueue.h"
+#include "foundation/Mutex.h"
 #include "foundation/RunLoop.h"
 
 #include <atomic>
@@ -52,8 +53,8 @@ private:
     RunLoop& _loop;
     DeliveryQueue _queue;
     std::atomic<bool> _largeLogged = false;
-    std::mutex _seenMutex;
-    SeenPosts _seen; // guarded by _seenMutex
+    Mutex _seenMutex;
+    SeenPosts _seen GUARDED_BY(_seenMutex);
     bool _suspended = false;
     bool _deliveryScheduled = false;
     int _arrived; // eventfd: another thread has put something into the queue

@@ -1,8 +1,8 @@
+#include "foundation/Mutex.h"
 #include "foundation/Notification.h"
 
 #include <algorithm>
 #include <atomic>
-#include <mutex>
 #include <vector>
 
 namespace rolvane {
@@ -26,20 +26,20 @@ struct NotificationCenter::Impl {
     };
 
     void remove(const std::shared_ptr<Observer>& observer) {
-        std::lock_guard guard(mutex);
+        Lock guard(mutex);
         std::erase(observers, observer);
     }
 
     std::vector<std::shared_ptr<Observer>> observersOf(const std::string& name) const {
-        std::lock_guard guard(mutex);
+        Lock guard(mutex);
         std::vector<std::shared_ptr<Observer>> out;
         std::copy_if(observers.begin(), observers.end(), std::back_inserter(out),
                      [&](const auto& observer) { return observer->name == name; });
         return out;
     }
 
-    mutable std::mutex mutex;
-    std::vector<std::shared_ptr<Observer>> observers; // in order of registration
+    mutable Mutex mutex;
+    std::vector<std::shared_ptr<Observer>> observers GUARDED_BY(mutex); // in order of registration
 };
 
 NotificationCenter::NotificationCenter() : _impl(std::make_shared<Impl>()) {}
@@ -55,7 +55,7 @@ ObservationHandle NotificationCenter::observe(std::string name, NotificationHand
     observer->name = std::move(name);
     observer->handler = std::move(handler);
     {
-        std::lock_guard guard(_impl->mutex);
+        Lock guard(_impl->mutex);
         _impl->observers.push_back(observer);
     }
     return std::make_unique<Impl::Registration>(_impl, std::move(observer));

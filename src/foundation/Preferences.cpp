@@ -2,12 +2,12 @@
 
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "foundation/Mutex.h"
 #include "foundation/Paths.h"
 #include "foundation/PreferencesFile.h"
 #include "foundation/PropertyList.h"
 
 #include <map>
-#include <mutex>
 #include <set>
 
 #include <fmt/format.h>
@@ -15,10 +15,10 @@
 namespace rolvane {
 
 struct Preferences::Impl {
-    Impl(std::string path, double lockTimeout) : file(std::move(path), lockTimeout) {}
+    Impl(std::string place, double lockTimeout) : path(place), file(std::move(place), lockTimeout) {}
 
-    // The unwritten change of a key, if there is one. With the mutex held.
-    const std::optional<Bytes>* unwritten(std::string_view domain, std::string_view key) const {
+    // The unwritten change of a key, if there is one.
+    const std::optional<Bytes>* unwritten(std::string_view domain, std::string_view key) const REQUIRES(mutex) {
         auto changes = staged.find(domain);
         if (changes == staged.end()) return nullptr;
         auto change = changes->second.find(key);
@@ -26,7 +26,7 @@ struct Preferences::Impl {
     }
 
     void stage(std::string_view domain, std::string_view key, std::optional<Bytes> bytes) {
-        std::lock_guard guard(mutex);
+        Lock guard(mutex);
         auto changes = staged.try_emplace(std::string(domain)).first;
         changes->second.insert_or_assign(std::string(key), std::move(bytes));
     }
@@ -39,14 +39,16 @@ struct Preferences::Impl {
                 kCXArchiveException,
                 fmt::format("The value of \"{}\" in the domain \"{}\" of the preferences file \"{}\" is damaged "
                             "({}). It was left as it is. Restore the file from a backup, or delete the value.",
-                            key, domain, file.path(), e.reason()));
+                            key, domain, path, e.reason()));
         }
     }
 
-    bool isKept(std::string_view domain, std::string_view key) const { return keeper && keeper->keeps(domain, key); }
+    bool isKept(std::string_view domain, std::string_view key) const REQUIRES(mutex) {
+        return keeper && keeper->keeps(domain, key);
+    }
 
     // Moves what an earlier version left in the file. The removal comes last, so a crash repeats the whole.
-    void move() {
+    void move() REQUIRES(mutex) {
         if (!keeper || moved) return;
         PreferencesFile::Changes values, removals;
         for (const std::string& key : file.keys(keeper->domain()))
@@ -61,7 +63,7 @@ struct Preferences::Impl {
         moved = true;
     }
 
-    bool hasMoved() {
+    bool hasMoved() REQUIRES(mutex) {
         try {
             move();
         } catch (const CXException& e) {
@@ -71,14 +73,14 @@ struct Preferences::Impl {
         return true;
     }
 
-    std::optional<Bytes> read(std::string_view domain, std::string_view key) {
+    std::optional<Bytes> read(std::string_view domain, std::string_view key) REQUIRES(mutex) {
         if (!isKept(domain, key)) return file.read(domain, key);
         if (!hasMoved())
             if (auto bytes = file.read(domain, key)) return bytes;
         return keeper->read(key);
     }
 
-    void write(std::string_view domain, PreferencesFile::Changes& changes) {
+    void write(std::string_view domain, PreferencesFile::Changes& changes) REQUIRES(mutex) {
         PreferencesFile::Changes kept;
         for (auto change = changes.begin(); change != changes.end();)
             if (isKept(domain, change->first))
@@ -102,7 +104,7 @@ struct Preferences::Impl {
         changes.merge(kept);
     }
 
-    std::set<std::string> keysWithChanges(std::string_view domain) {
+    std::set<std::string> keysWithChanges(std::string_view domain) REQUIRES(mutex) {
         auto stored = file.keys(domain);
         std::set<std::string> all(stored.begin(), stored.end());
         if (keeper && keeper->domain() == domain && hasMoved())
@@ -117,12 +119,13 @@ struct Preferences::Impl {
         return all;
     }
 
-    std::mutex mutex; // of everything below
-    PreferencesFile file;
-    std::shared_ptr<PreferencesKeeper> keeper;
-    bool moved = false; // the file has nothing of the keeper's any more
-    bool held = false;
-    std::map<std::string, PreferencesFile::Changes, std::less<>> staged;
+    const std::string path;
+    Mutex mutex;
+    PreferencesFile file GUARDED_BY(mutex);
+    std::shared_ptr<PreferencesKeeper> keeper GUARDED_BY(mutex);
+    bool moved GUARDED_BY(mutex) = false; // the file has nothing of the keeper's any more
+    bool held GUARDED_BY(mutex) = false;
+    std::map<std::string, PreferencesFile::Changes, std::less<>> staged GUARDED_BY(mutex);
 };
 
 Preferences::Preferences(std::string path, double lockTimeoutSeconds)
@@ -133,7 +136,7 @@ Preferences::~Preferences() = default;
 Value Preferences::get(std::string_view domain, std::string_view key) const {
     std::optional<Bytes> bytes;
     {
-        std::lock_guard guard(_impl->mutex);
+        Lock guard(_impl->mutex);
         if (auto* change = _impl->unwritten(domain, key))
             bytes = *change;
         else
@@ -156,7 +159,7 @@ void Preferences::remove(std::string_view domain, std::string_view key) {
 }
 
 void Preferences::synchronize(std::string_view domain) {
-    std::lock_guard guard(_impl->mutex);
+    Lock guard(_impl->mutex);
     auto changes = _impl->staged.find(domain);
     if (changes == _impl->staged.end()) return;
     _impl->write(domain, changes->second);
@@ -164,13 +167,13 @@ void Preferences::synchronize(std::string_view domain) {
 }
 
 void Preferences::keepElsewhere(std::shared_ptr<PreferencesKeeper> keeper) {
-    std::lock_guard guard(_impl->mutex);
+    Lock guard(_impl->mutex);
     _impl->keeper = std::move(keeper);
     _impl->moved = false;
 }
 
 Preferences::Hold::Hold(Preferences& preferences) : _preferences(preferences) {
-    std::lock_guard guard(_preferences._impl->mutex);
+    Lock guard(_preferences._impl->mutex);
     _preferences._impl->held = true;
 }
 
@@ -180,7 +183,7 @@ Preferences::Hold::~Hold() {
 
 PreferencesChanges Preferences::Hold::changes() const {
     Impl& all = *_preferences._impl;
-    std::lock_guard guard(all.mutex);
+    Lock guard(all.mutex);
     all.move();
     PreferencesChanges kept;
     if (!all.keeper) return kept;
@@ -193,23 +196,24 @@ PreferencesChanges Preferences::Hold::changes() const {
 void Preferences::Hold::end() {
     _holds = false;
     Impl& all = *_preferences._impl;
-    std::lock_guard guard(all.mutex);
+    Lock guard(all.mutex);
     all.held = false;
     if (!all.keeper) return;
     const auto changes = all.staged.find(all.keeper->domain());
     if (changes == all.staged.end()) return;
-    std::erase_if(changes->second, [&](const auto& change) { return all.keeper->keeps(changes->first, change.first); });
+    std::erase_if(changes->second, [&](const auto& change)
+                                       REQUIRES(all.mutex) { return all.keeper->keeps(changes->first, change.first); });
     if (changes->second.empty()) all.staged.erase(changes);
 }
 
 std::vector<std::string> Preferences::keys(std::string_view domain) const {
-    std::lock_guard guard(_impl->mutex);
+    Lock guard(_impl->mutex);
     auto all = _impl->keysWithChanges(domain);
     return {all.begin(), all.end()};
 }
 
 std::vector<std::string> Preferences::domains() const {
-    std::lock_guard guard(_impl->mutex);
+    Lock guard(_impl->mutex);
     auto stored = _impl->file.domains();
     std::set<std::string> all(stored.begin(), stored.end());
     if (_impl->keeper && !_impl->keysWithChanges(_impl->keeper->domain()).empty()) all.insert(_impl->keeper->domain());
@@ -223,13 +227,13 @@ std::vector<std::string> Preferences::domains() const {
 }
 
 const std::string& Preferences::path() const {
-    return _impl->file.path();
+    return _impl->path;
 }
 
 Preferences& Preferences::shared() {
-    static auto* mutex = new std::mutex;
+    static auto* mutex = new Mutex;
     static auto* all = new std::map<std::string, std::unique_ptr<Preferences>>;
-    std::lock_guard guard(*mutex);
+    Lock guard(*mutex);
     auto& one = (*all)[stateDirectory() + "/preferences.db"];
     if (!one) one = std::make_unique<Preferences>(stateDirectory() + "/preferences.db");
     return *one;

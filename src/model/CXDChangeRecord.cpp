@@ -2,6 +2,7 @@
 
 #include "contacts/records/Constants.h"
 #include "foundation/CXException.h"
+#include "foundation/Mutex.h"
 #include "foundation/PropertyList.h"
 #include "model/PayloadKeys.h"
 #include "store/files/CXFileManager.h"
@@ -83,16 +84,16 @@ struct CXDChangeRecord::Payload : SharedObject {
     explicit Payload(std::shared_ptr<const Bytes> bytes) : encoded(std::move(bytes)) {}
 
     Value decoded() {
-        const std::lock_guard guard(lock());
+        const Lock guard(lock());
         if (!value && encoded) value = BinaryValue::decode(*encoded);
         return value;
     }
     std::shared_ptr<const Bytes> untouched() const {
-        const std::lock_guard guard(lock());
+        const Lock guard(lock());
         return value ? nullptr : encoded;
     }
     Bytes bytes() const {
-        const std::lock_guard guard(lock());
+        const Lock guard(lock());
         if (value) return BinaryValue::encode(value);
         return encoded ? *encoded : Bytes();
     }
@@ -107,7 +108,7 @@ struct CXDChangeRecord::Payload : SharedObject {
         return Value(all);
     }
     void pack() {
-        const std::lock_guard guard(lock());
+        const Lock guard(lock());
         if (!value) return;
         Bytes now = BinaryValue::encode(value);
         if (!encoded || *encoded != now) encoded = std::make_shared<const Bytes>(std::move(now));
@@ -116,8 +117,8 @@ struct CXDChangeRecord::Payload : SharedObject {
 
 private:
     // A few locks for all: one in each of a hundred thousand payloads would be memory for nothing.
-    std::mutex& lock() const {
-        static std::array<std::mutex, 32> all;
+    Mutex& lock() const {
+        static std::array<Mutex, 32> all;
         return all[(reinterpret_cast<uintptr_t>(this) >> 6) % all.size()];
     }
     Value value;

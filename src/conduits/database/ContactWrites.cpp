@@ -5,6 +5,7 @@
 #include "contacts/records/Constants.h"
 #include "contacts/records/Identifier.h"
 #include "foundation/Log.h"
+#include "foundation/Mutex.h"
 #include "foundation/PropertyList.h"
 #include "foundation/TestSwitch.h"
 #include "model/PayloadKeys.h"
@@ -151,14 +152,14 @@ bool ContactWrites::writeMerged(const Place& place, const Dictionary& ours, cons
         done = put(place, content, code);
     }
     if (done && merge.contact != here) {
-        const std::lock_guard guard(_lock);
+        const Lock guard(_lock);
         _merged.push_back({place, merge.contact});
     }
     return done;
 }
 
 std::vector<ContactWrites::Merged> ContactWrites::takeMerged() {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     return std::exchange(_merged, {});
 }
 

@@ -2,12 +2,12 @@
 
 #include "contacts/database/CXRolvane.h"
 #include "contacts/records/ContactMerge.h"
+#include "foundation/Mutex.h"
 #include "foundation/Url.h"
 #include "foundation/Value.h"
 #include "model/CXDChangeRecord.h"
 
 #include <functional>
-#include <mutex>
 #include <optional>
 #include <unordered_set>
 #include <vector>
@@ -83,8 +83,8 @@ private:
     CXDAVManager& _manager;
     CXRolvane& _rolvane;
     std::unordered_set<UniqueId> _new; // of this pass; constant while it writes
-    std::mutex _lock;
-    std::vector<Merged> _merged; // guarded by _lock
+    Mutex _lock;
+    std::vector<Merged> _merged GUARDED_BY(_lock);
 };
 
 } // namespace rolvane

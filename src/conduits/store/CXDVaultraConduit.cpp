@@ -7,6 +7,7 @@
 #include "contacts/database/CXRolvane.h"
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "foundation/Mutex.h"
 #include "foundation/Preferences.h"
 #include "foundation/TestSwitch.h"
 #include "model/PayloadKeys.h"
@@ -15,7 +16,6 @@
 #include "store/dav/CXDAVManager.h"
 
 #include <future>
-#include <mutex>
 #include <utility>
 
 namespace rolvane {
@@ -56,7 +56,7 @@ CXFileManager* CXDVaultraConduit::defaultManager() const {
 
 std::optional<Url> CXDVaultraConduit::baseLocationForUser(const std::optional<UserName>& user) const {
     if (!user) return std::nullopt;
-    const std::lock_guard guard(_basesLock);
+    const Lock guard(_basesLock);
     const auto [found, isNew] = _bases.try_emplace(*user);
     if (isNew) found->second = _world.manager.account().baseLocationFor(*user);
     return found->second;
@@ -106,7 +106,7 @@ void CXDVaultraConduit::lookAfterStructure(bool meanwhile) {
         sanityCheckPublishStructure();
         return;
     }
-    const std::lock_guard guard(_structureLock);
+    const Lock guard(_structureLock);
     _structure = std::async(std::launch::async, [this] {
         try {
             sanityCheckPublishStructure();
@@ -117,7 +117,7 @@ void CXDVaultraConduit::lookAfterStructure(bool meanwhile) {
 }
 
 void CXDVaultraConduit::awaitStructure() {
-    const std::lock_guard guard(_structureLock);
+    const Lock guard(_structureLock);
     if (_structure.valid()) _structure.get();
 }
 

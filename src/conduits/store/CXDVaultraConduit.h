@@ -3,6 +3,7 @@
 #include "conduits/CXDConduit.h"
 #include "conduits/database/ContactWrites.h"
 #include "conduits/store/NewOnStore.h"
+#include "foundation/Mutex.h"
 #include "foundation/Notification.h"
 #include "store/dav/CXDAVManager.h"
 
@@ -11,7 +12,6 @@
 #include <future>
 #include <map>
 #include <memory>
-#include <mutex>
 #include <set>
 #include <string>
 #include <unordered_map>
@@ -217,12 +217,12 @@ private:
     std::map<UserName, Comparison> _foundNothing; // the last comparisons that found nothing
     std::map<UserName, Comparison> _compared;     // those of the gathering that is under way
     bool _gathering = false;                      // `open` belongs to a gathering
-    std::mutex _structureLock;
-    std::future<void> _structure; // the look at the own tree that is under way; guarded by _structureLock
+    Mutex _structureLock;
+    std::future<void> _structure GUARDED_BY(_structureLock); // the look at the own tree that is under way
     // The account is the manager's for good, and every record asks for its user's base location several times.
     std::future<std::optional<Date>> _serverDate; // asked for in advance
-    mutable std::mutex _basesLock;
-    mutable std::unordered_map<UserName, Url> _bases; // guarded by _basesLock
+    mutable Mutex _basesLock;
+    mutable std::unordered_map<UserName, Url> _bases GUARDED_BY(_basesLock);
     ObservationHandle _simulated, _networkChanged;
 };
 

@@ -1,6 +1,7 @@
 #include "conduits/store/NewOnStore.h"
 
 #include "contacts/records/Constants.h"
+#include "foundation/Mutex.h"
 #include "foundation/TestSwitch.h"
 
 namespace rolvane {
@@ -14,7 +15,7 @@ bool isContact(const UniqueId& record) {
 
 void NewOnStore::beginPass(const std::unordered_set<UniqueId>& newRecords) {
     const std::vector<CXReached> noted = _rolvane.reached();
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     _newRecords = &newRecords;
     _named.clear();
     _waiting.clear();
@@ -24,18 +25,18 @@ void NewOnStore::beginPass(const std::unordered_set<UniqueId>& newRecords) {
 }
 
 void NewOnStore::listWaits(const std::vector<UniqueId>& records) {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     _waiting.insert(records.begin(), records.end());
 }
 
 bool NewOnStore::waitsForList(const UniqueId& record) {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     return _waiting.contains(record);
 }
 
 void NewOnStore::wasPut(const UserName& tree, const UniqueId& record, Date now) {
     {
-        const std::lock_guard guard(_lock);
+        const Lock guard(_lock);
         const bool wasAlone = _alone.erase(record) > 0;
         if (!_named.erase(record) && !wasAlone) {
             _put.insert(record);
@@ -48,7 +49,7 @@ void NewOnStore::wasPut(const UserName& tree, const UniqueId& record, Date now) 
 void NewOnStore::willName(const UserName& tree, const std::vector<UniqueId>& records, Date now) {
     std::vector<CXReached> reached;
     {
-        const std::lock_guard guard(_lock);
+        const Lock guard(_lock);
         for (const UniqueId& record : records)
             if (_put.erase(record)) {
                 reached.push_back({record, tree, now});
@@ -63,7 +64,7 @@ void NewOnStore::willName(const UserName& tree, const std::vector<UniqueId>& rec
 }
 
 bool NewOnStore::isNamedAlone(const UniqueId& contact) {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     return _alone.contains(contact);
 }
 

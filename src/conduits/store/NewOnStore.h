@@ -1,8 +1,8 @@
 #pragma once
 
 #include "contacts/database/CXRolvane.h"
+#include "foundation/Mutex.h"
 
-#include <mutex>
 #include <unordered_set>
 #include <vector>
 
@@ -31,7 +31,7 @@ public:
     // wait, groups that name one of them, and deletions: whoever reads half a record would list it, or take it for
     // lost.
     void listWaits(const std::vector<UniqueId>& records);
-    bool waitsForList(const UniqueId& record); // in this pass
+    bool waitsForList(const UniqueId& record);  // in this pass
     bool isNamedAlone(const UniqueId& contact); // its file is not known to have come
 
 private:
@@ -39,11 +39,11 @@ private:
 
     CXRolvane& _rolvane;
     const std::unordered_set<UniqueId>* _newRecords = nullptr;
-    std::mutex _lock;
-    std::unordered_set<UniqueId> _put;     // without a name, of all passes of this process; guarded by _lock
-    std::unordered_set<UniqueId> _named;   // without a file, of this pass; guarded by _lock
-    std::unordered_set<UniqueId> _alone;   // contacts without a file, of all passes; guarded by _lock
-    std::unordered_set<UniqueId> _waiting; // for the list, in this pass; guarded by _lock
+    Mutex _lock;
+    std::unordered_set<UniqueId> _put GUARDED_BY(_lock);     // without a name, of all passes of this process
+    std::unordered_set<UniqueId> _named GUARDED_BY(_lock);   // without a file, of this pass
+    std::unordered_set<UniqueId> _alone GUARDED_BY(_lock);   // contacts without a file, of all passes
+    std::unordered_set<UniqueId> _waiting GUARDED_BY(_lock); // for the list, in this pass
 };
 
 } // namespace rolvane

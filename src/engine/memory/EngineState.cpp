@@ -4,6 +4,7 @@
 #include "foundation/CXException.h"
 #include "foundation/KeyedArchive.h"
 #include "foundation/Log.h"
+#include "foundation/Mutex.h"
 #include "foundation/Paths.h"
 #include "foundation/TestSwitch.h"
 #include "model/PayloadKeys.h"
@@ -47,44 +48,44 @@ Dictionary EngineState::loadedConduitData() {
 }
 
 Dictionary EngineState::conduitData() {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     return loadedConduitData();
 }
 
 void EngineState::dropConduitData() {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     _isDropped = true;
 }
 
 uint64_t EngineState::generation() {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     loadedConduitData();
     return _generation;
 }
 
 void EngineState::withConduitData(const std::function<void(Dictionary&)>& use) {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     Dictionary data = loadedConduitData();
     use(data);
 }
 
 Dictionary EngineState::conduitObjectForKey(const std::string& conduitID, const std::string& key) {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     return loadedConduitData().dictionaryFor(conduitID).dictionaryFor(key);
 }
 
 void EngineState::setConduitObjectForKey(const std::string& conduitID, const Value& object, const std::string& key) {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     loadedConduitData().dictionaryFor(conduitID).set(key, object);
 }
 
 void EngineState::putConduitData() {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     put(stateRows(loadedConduitData()));
 }
 
 void EngineState::putConduitDataWith(const Dictionary& marks) {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     Dictionary data = loadedConduitData().mutableCopy();
     Dictionary cx = data[kConduitCX].dictionary().mutableCopy();
     for (const auto& [key, before] : marks) {
@@ -97,7 +98,7 @@ void EngineState::putConduitDataWith(const Dictionary& marks) {
 }
 
 Dictionary EngineState::marks() {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     const Dictionary cx = loadedConduitData()[kConduitCX].dictionary();
     Dictionary marks;
     for (const char* key : {kUnsettledGroups, kUnsettledPeople})
@@ -106,7 +107,7 @@ Dictionary EngineState::marks() {
 }
 
 void EngineState::forgetPut() noexcept {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     _putAll = true;
     ++_generation;
 }
@@ -222,24 +223,24 @@ void EngineState::noteRefusedByOwnStore(size_t changes, std::optional<Date> when
 }
 
 void EngineState::noteRefused(const Refusal& refusal) {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     _refused.push_back(refusal);
 }
 
 std::vector<Refusal> EngineState::takeRefused() {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     return std::exchange(_refused, {});
 }
 
 void EngineState::setRemoteLocationForSubscriptionUID(const std::optional<RemoteLocation>& location,
                                                       const std::optional<UniqueId>& subscription) {
     if (!location || !subscription) return;
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     loadedConduitData().dictionaryFor(kSubscriptionMap).set(subscription->str(), *location);
 }
 
 std::optional<RemoteLocation> EngineState::remoteLocationForSubscriptionUID(const UniqueId& subscription) {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     const Value map = loadedConduitData()[kSubscriptionMap];
     const Dictionary* locations = map.dictionaryIf();
     const std::string* location = locations ? (*locations)[subscription.str()].stringIf() : nullptr;
@@ -247,7 +248,7 @@ std::optional<RemoteLocation> EngineState::remoteLocationForSubscriptionUID(cons
 }
 
 void EngineState::removeSubscriptionMapForRemoteLocation(const RemoteLocation& location) {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     const Value map = loadedConduitData()[kSubscriptionMap];
     if (!map.isDictionary()) return;
     Dictionary locations = map.dictionary();
@@ -256,13 +257,13 @@ void EngineState::removeSubscriptionMapForRemoteLocation(const RemoteLocation& l
 }
 
 void EngineState::removeSubscription(const UniqueId& subscription) {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     const Value map = loadedConduitData()[kSubscriptionMap];
     if (map.isDictionary()) map.dictionary().remove(subscription.str());
 }
 
 bool EngineState::isOfFormerSubscription(const RemoteLocation& location, const UniqueId& subscription) {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     const Value map = loadedConduitData()[kSubscriptionMap];
     const Dictionary* locations = map.dictionaryIf();
     if (!locations || locations->contains(subscription.str())) return false;
@@ -305,7 +306,7 @@ void EngineState::reset() {
     for (const std::string& key : _preferences.keys(kDaemonDomain))
         if (isStateRow(key)) _preferences.remove(kDaemonDomain, key);
     _preferences.synchronize(kDaemonDomain);
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     _conduitData.reset();
 }
 

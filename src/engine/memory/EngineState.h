@@ -1,6 +1,7 @@
 #pragma once
 
 #include "engine/memory/StateRows.h"
+#include "foundation/Mutex.h"
 #include "foundation/Preferences.h"
 #include "foundation/StrongString.h"
 #include "foundation/Value.h"
@@ -8,7 +9,6 @@
 #include "model/Refusal.h"
 
 #include <functional>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
@@ -95,19 +95,19 @@ public:
     Preferences& preferences() const { return _preferences; }
 
 private:
-    Dictionary loadedConduitData(); // with _lock held, as the next two
-    bool isAsStored();
-    void put(const StateRows& rows);
+    Dictionary loadedConduitData() REQUIRES(_lock);
+    bool isAsStored() REQUIRES(_lock);
+    void put(const StateRows& rows) REQUIRES(_lock);
 
     Preferences& _preferences;
-    std::mutex _lock;
-    std::optional<Dictionary> _conduitData; // guarded by _lock, as are the following
-    StateRows _stored;                      // as the preferences have them, set or synchronised
-    bool _putAll = false;                   // they may have others
-    bool _isDropped = false;                // to be read again, unless nothing has changed
-    Value _edition;                         // of _stored
-    uint64_t _generation = 0;
-    std::vector<Refusal> _refused;
+    Mutex _lock;
+    std::optional<Dictionary> _conduitData GUARDED_BY(_lock);
+    StateRows _stored GUARDED_BY(_lock);       // as the preferences have them, set or synchronised
+    bool _putAll GUARDED_BY(_lock) = false;    // they may have others
+    bool _isDropped GUARDED_BY(_lock) = false; // to be read again, unless nothing has changed
+    Value _edition GUARDED_BY(_lock);          // of _stored
+    uint64_t _generation GUARDED_BY(_lock) = 0;
+    std::vector<Refusal> _refused GUARDED_BY(_lock);
 };
 
 } // namespace rolvane

@@ -5,6 +5,7 @@
 #include "engine/queue/RefusedChanges.h"
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "foundation/Mutex.h"
 
 #include <algorithm>
 #include <charconv>
@@ -113,7 +114,7 @@ void OutOfOrderWork::outOfOrderWorkLoop() {
         record->setAppliedToSources(applied);
         if (applied != wanted) {
             record->setAppliesToSources(applied ^ wanted);
-            const std::lock_guard guard(_processedChangesLock);
+            const Lock guard(_processedChangesLock);
             _pending.push_back(record);
         }
         _turns.done(*record);
@@ -152,7 +153,7 @@ bool OutOfOrderWork::applyTo(CXDConduit& conduit, int32_t source, const CXDChang
     }
     if (isGivenUp(_parts, *record)) return true;
     _parts.outcomes.applied(*record, source);
-    const std::lock_guard guard(_processedChangesLock);
+    const Lock guard(_processedChangesLock);
     _parts.state.withConduitData([&](Dictionary& data) {
         didApplyChange(data, *record, source);
         forgetRefusedChange(data, *record);

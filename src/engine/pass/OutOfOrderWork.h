@@ -3,10 +3,10 @@
 #include "engine/EngineParts.h"
 #include "engine/pass/RecordTurns.h"
 #include "foundation/ConditionLock.h"
+#include "foundation/Mutex.h"
 #include "model/CXDChangeRecord.h"
 
 #include <deque>
-#include <mutex>
 #include <thread>
 #include <unordered_set>
 #include <vector>
@@ -32,15 +32,16 @@ public:
     void start(int64_t workers);
     // Returns when every record has been handled; the lock is held from then on. Without workers and with records it
     // never returns, unless the process is asked to end.
-    void wait();
+    void wait() NO_THREAD_SAFETY_ANALYSIS; // `finish` gives back the lock that it takes
     // Ends the workers that are still waiting for more. After it nothing of this object is shared with any thread.
-    void finish();
+    void finish() NO_THREAD_SAFETY_ANALYSIS;
 
-    size_t processedCount() const { return _processedCount; } // after wait
+    size_t processedCount() const NO_THREAD_SAFETY_ANALYSIS { return _processedCount; } // after wait
     size_t workers() const { return _workers.size(); }
-    const CXDChangeRecords& pending() const { return _pending; } // once nobody works any more
-    CXDChangeRecords takePending();                              // after finish
-    CXDChangeRecords takeUntouched();                            // after finish: what nobody has taken
+    // Once nobody works any more nothing guards them.
+    const CXDChangeRecords& pending() const NO_THREAD_SAFETY_ANALYSIS { return _pending; }
+    CXDChangeRecords takePending() NO_THREAD_SAFETY_ANALYSIS;   // after finish
+    CXDChangeRecords takeUntouched() NO_THREAD_SAFETY_ANALYSIS; // after finish: what nobody has taken
 
 private:
     void outOfOrderWorkLoop();
@@ -52,13 +53,13 @@ private:
     EngineParts& _parts;
     RecordTurns _turns;
     ConditionLock _outOfOrderLock;
-    std::deque<CXDChangeRecordPtr> _records;         // guarded by _outOfOrderLock
-    std::unordered_set<CXDChangeRecordPtr> _waiting; // for a list, in a worker's hands; guarded by _outOfOrderLock
-    std::unordered_set<UserName> _cancelledUsers;    // guarded by _outOfOrderLock
-    size_t _processedCount = 0;                      // guarded by _outOfOrderLock
+    std::deque<CXDChangeRecordPtr> _records GUARDED_BY(_outOfOrderLock);
+    std::unordered_set<CXDChangeRecordPtr> _waiting GUARDED_BY(_outOfOrderLock); // for a list, in a worker's hands
+    std::unordered_set<UserName> _cancelledUsers GUARDED_BY(_outOfOrderLock);
+    size_t _processedCount GUARDED_BY(_outOfOrderLock) = 0;
     const size_t _changeCount;
-    std::mutex _processedChangesLock;
-    CXDChangeRecords _pending; // guarded by _processedChangesLock
+    Mutex _processedChangesLock;
+    CXDChangeRecords _pending GUARDED_BY(_processedChangesLock);
     std::vector<std::thread> _workers;
     bool _workHere = false;
     bool _lockHeld = false; // by the main thread, after wait

@@ -3,13 +3,14 @@
 #include "foundation/BootTime.h"
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "foundation/Mutex.h"
 
 #include <utility>
 
 namespace rolvane {
 
 void OutcomeKeeper::begin(bool full, bool retry) {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     _facts = {};
     _facts.began = _clock.now();
     _facts.beganSinceBoot = secondsSinceBoot();
@@ -27,55 +28,55 @@ void OutcomeKeeper::begin(bool full, bool retry) {
 }
 
 void OutcomeKeeper::storeWasTested(bool reached, std::optional<PassFailure> why) {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     _facts.storeReached = reached;
     _facts.storeFailure = reached ? std::nullopt : std::move(why);
 }
 
 void OutcomeKeeper::treeWasLookedAt(const UserName& user, TreeLook how) {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     _facts.looks[user] = how;
 }
 
 std::optional<TreeLook> OutcomeKeeper::lookAt(const UserName& user) const {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     const auto look = _facts.looks.find(user);
     return look == _facts.looks.end() ? std::nullopt : std::optional(look->second);
 }
 
 void OutcomeKeeper::tried(const CXDChangeRecord& record) {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     _facts.counts[record.user().value_or(UserName())].toldToSend = true;
 }
 
 void OutcomeKeeper::applied(const CXDChangeRecord& record, int32_t source) {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     PassFacts::Counts& counts = _facts.counts[record.user().value_or(UserName())];
     ++(source == CXDSyncSourceVaultra ? counts.sent : counts.received);
 }
 
 void OutcomeKeeper::refused(const UserName& user) {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     ++_facts.counts[user].refused;
 }
 
 void OutcomeKeeper::rests(const UserName& user, int64_t changes) {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     _facts.counts[user].resting = changes;
 }
 
 void OutcomeKeeper::leaves(const CXDChangeRecords& pending) {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     countLeftOver(_facts, pending);
 }
 
 void OutcomeKeeper::caught(const std::string& exception) {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     if (!_facts.exception) _facts.exception = exception;
 }
 
 void OutcomeKeeper::couldNotStore(const std::string& exception) {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     if (!_facts.storage) _facts.storage = exception;
 }
 
@@ -92,14 +93,14 @@ void OutcomeKeeper::settle() {
 }
 
 void OutcomeKeeper::put() {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     settle();
     _put = outcomeOf(_facts, _previous, _clock.now());
     _preferences.set(kDaemonDomain, kCXDPassOutcome, encodeOutcome(*_put));
 }
 
 PassOutcome OutcomeKeeper::end() {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     _running = false;
     settle();
     PassOutcome outcome = outcomeOf(_facts, _previous, _put ? _put->ended : _clock.now());

@@ -1,10 +1,10 @@
 #pragma once
 
 #include "engine/pass/PassFacts.h"
+#include "foundation/Mutex.h"
 #include "foundation/Preferences.h"
 
 #include <functional>
-#include <mutex>
 #include <optional>
 #include <string>
 
@@ -49,14 +49,14 @@ public:
     static PassOutcome endWithoutAPass(Preferences& preferences, const Clock& clock, const std::string& exception);
 
 private:
-    void settle();
+    void settle() REQUIRES(_lock);
 
     Preferences& _preferences;
     const Clock& _clock;
     Sources _sources;
     bool _running = false;
-    mutable std::mutex _lock;
-    PassFacts _facts;                     // guarded by _lock
+    mutable Mutex _lock;
+    PassFacts _facts GUARDED_BY(_lock);
     std::optional<PassOutcome> _previous; // of this process, stored or not
     std::optional<PassOutcome> _put;
 };

@@ -1,6 +1,7 @@
 #include "engine/pass/RecordTurns.h"
 
 #include "engine/queue/ChangeQueue.h"
+#include "foundation/Mutex.h"
 
 #include <functional>
 
@@ -60,11 +61,13 @@ void RecordTurns::order(const CXDChangeRecords& records, const std::function<boo
         if (comesBehindTheList(*record)) before.other = true;
         if (!isListOfEverybody(*record)) continue;
         if (const auto known = _trees.find(*record->user()); known != _trees.end()) {
+            const Lock guard(known->second->lock);
             if (!before.other) ++known->second->lists; // a change that waited, and a new one
             continue;
         }
         if (!inOrder(*record->user())) continue;
         Tree& tree = *_trees.emplace(*record->user(), std::make_unique<Tree>()).first->second;
+        const Lock guard(tree.lock);
         tree.contacts = before.contacts;
         tree.lists = before.other ? 0 : 1; // nobody waits for one that is behind
     }
@@ -82,7 +85,7 @@ bool RecordTurns::waitsForList(const CXDChangeRecord& record) const {
 
 void RecordTurns::await(const CXDChangeRecord& record) const {
     if (Tree* tree = isListOfEverybody(record) || comesBehindTheList(record) ? treeOf(record) : nullptr) {
-        std::unique_lock guard(tree->lock);
+        Lock guard(tree->lock);
         const size_t& before = isListOfEverybody(record) ? tree->contacts : tree->lists;
         tree->changed.wait(guard, [&] { return before == 0; });
     }
@@ -92,7 +95,7 @@ void RecordTurns::await(const CXDChangeRecord& record) const {
 
 void RecordTurns::done(const CXDChangeRecord& record) {
     if (Tree* tree = isContact(record) || isListOfEverybody(record) ? treeOf(record) : nullptr) {
-        const std::lock_guard guard(tree->lock);
+        const Lock guard(tree->lock);
         size_t& left = isContact(record) ? tree->contacts : tree->lists;
         if (left > 0 && --left == 0) tree->changed.notify_all();
     }

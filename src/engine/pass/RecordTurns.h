@@ -1,12 +1,11 @@
 #pragma once
 
+#include "foundation/Mutex.h"
 #include "model/CXDChangeRecord.h"
 
-#include <condition_variable>
 #include <functional>
 #include <latch>
 #include <memory>
-#include <mutex>
 #include <unordered_map>
 
 namespace rolvane {
@@ -34,9 +33,9 @@ private:
     };
     // Of a tree whose list waits, and is waited for.
     struct Tree {
-        std::mutex lock;
-        std::condition_variable changed;
-        size_t contacts = 0, lists = 0; // that are not done yet; guarded by lock
+        Mutex lock;
+        Condition changed;
+        size_t contacts GUARDED_BY(lock) = 0, lists GUARDED_BY(lock) = 0; // that are not done yet
     };
     void order(const CXDChangeRecords& records, const std::function<bool(const UserName&)>& inOrder);
     Tree* treeOf(const CXDChangeRecord& record) const; // none where nothing waits

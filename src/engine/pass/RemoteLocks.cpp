@@ -2,6 +2,7 @@
 
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "foundation/Mutex.h"
 #include "foundation/SignOfLife.h"
 #include "foundation/TestSwitch.h"
 
@@ -38,8 +39,8 @@ bool renews(CXWebDAVLock& lock) {
 class SteadySleep : public InterruptibleSleep {
 public:
     bool sleep(double seconds) override {
-        std::unique_lock guard(_mutex);
-        const auto interrupted = [this] { return _interrupted; };
+        Lock guard(_mutex);
+        const auto interrupted = [this]() REQUIRES(_mutex) { return _interrupted; };
         // A day at a time keeps the arithmetic of any expiry date within the clock's range.
         const std::chrono::duration<double> time(std::min(seconds, 86400.0));
         const bool cut = _wake.wait_for(guard, time, interrupted);
@@ -47,15 +48,15 @@ public:
         return !cut && seconds <= 86400.0;
     }
     void interrupt() override {
-        const std::lock_guard guard(_mutex);
+        const Lock guard(_mutex);
         _interrupted = true;
         _wake.notify_all();
     }
 
 private:
-    std::mutex _mutex;
-    std::condition_variable _wake;
-    bool _interrupted = false; // guarded by _mutex
+    Mutex _mutex;
+    Condition _wake;
+    bool _interrupted GUARDED_BY(_mutex) = false;
 };
 
 } // namespace

@@ -2,14 +2,13 @@
 
 #include "foundation/ConditionLock.h"
 #include "foundation/Date.h"
+#include "foundation/Mutex.h"
 #include "foundation/Url.h"
 #include "store/locks/CXWebDAVLock.h"
 
 #include <atomic>
-#include <condition_variable>
 #include <future>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <thread>
@@ -61,13 +60,13 @@ private:
     };
     void renewLocks();
     void renewOnce(std::shared_ptr<CXWebDAVLock>& renewedLast);
-    void unlockList() const; // with the condition that the list's size says
+    void unlockList() const RELEASE(_locksLock); // with the condition that the list's size says
 
     LockFactory _makeLock;
     const Clock& _clock;
     std::unique_ptr<InterruptibleSleep> _sleep;
     mutable ConditionLock _locksLock{0}; // condition 1: _heldLocks is not empty (or the thread is to end)
-    std::vector<Held> _heldLocks;        // guarded by _locksLock; in the order they were taken
+    std::vector<Held> _heldLocks GUARDED_BY(_locksLock); // in the order they were taken
     std::atomic<bool> _ending{false};
     std::thread _renewer;
 };

@@ -1,13 +1,14 @@
 #include "engine/pass/Revocation.h"
 
 #include "engine/memory/EngineState.h"
+#include "foundation/Mutex.h"
 
 namespace rolvane {
 
 void Revocation::revoke(EngineState& state, const RemoteLocation& location, const UserName& user,
                         const std::optional<UniqueId>& subscription) {
     {
-        const std::lock_guard guard(_lock);
+        const Lock guard(_lock);
         _locations.push_back(location);
         _known.insert(location);
     }
@@ -16,17 +17,17 @@ void Revocation::revoke(EngineState& state, const RemoteLocation& location, cons
 }
 
 bool Revocation::contains(const RemoteLocation& location) const {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     return _known.count(location) != 0;
 }
 
 std::vector<RemoteLocation> Revocation::all() const {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     return _locations;
 }
 
 void Revocation::clear() {
-    const std::lock_guard guard(_lock);
+    const Lock guard(_lock);
     _locations.clear();
     _known.clear();
 }

@@ -1,8 +1,8 @@
 #pragma once
 
+#include "foundation/Mutex.h"
 #include "foundation/StrongString.h"
 
-#include <mutex>
 #include <optional>
 #include <unordered_set>
 #include <vector>
@@ -24,9 +24,9 @@ public:
     void clear();
 
 private:
-    mutable std::mutex _lock;
-    std::vector<RemoteLocation> _locations;    // guarded by _lock
-    std::unordered_set<RemoteLocation> _known; // guarded by _lock
+    mutable Mutex _lock;
+    std::vector<RemoteLocation> _locations GUARDED_BY(_lock);
+    std::unordered_set<RemoteLocation> _known GUARDED_BY(_lock);
 };
 
 } // namespace rolvane

@@ -1,9 +1,9 @@
 #pragma once
 
 #include "engine/queue/RecordIdentity.h"
+#include "foundation/Mutex.h"
 #include "model/CXDChangeRecord.h"
 
-#include <mutex>
 #include <unordered_set>
 
 namespace rolvane {
@@ -25,9 +25,9 @@ public:
     CXDChangeRecords all() const; // in no order; for the log
 
 private:
-    mutable std::mutex _lock;
-    std::unordered_set<CXDChangeRecordPtr, RecordHash, RecordEqual> _records; // guarded by _lock, as is
-    CXDChangeRecords _refused;
+    mutable Mutex _lock;
+    std::unordered_set<CXDChangeRecordPtr, RecordHash, RecordEqual> _records GUARDED_BY(_lock);
+    CXDChangeRecords _refused GUARDED_BY(_lock);
 };
 
 } // namespace rolvane

@@ -2,6 +2,7 @@
 
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "foundation/Mutex.h"
 #include "foundation/Paths.h"
 #include "foundation/Preferences.h"
 #include "foundation/PropertyList.h"
@@ -16,7 +17,7 @@ ConfigurationValues& ConfigurationValues::shared() {
 }
 
 void ConfigurationValues::updateIfNeeded() {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     try {
         const std::string path = configDirectory() + "/config.plist";
         struct stat st {};
@@ -43,7 +44,7 @@ Value ConfigurationValues::valueForKey(const std::string& key, Value defaultValu
         }
     }
     updateIfNeeded();
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     const Value& v = _file[key];
     return v ? v : defaultValue;
 }

@@ -1,8 +1,8 @@
 #pragma once
 
+#include "foundation/Mutex.h"
 #include "foundation/Value.h"
 
-#include <mutex>
 #include <string>
 
 namespace rolvane {
@@ -16,9 +16,9 @@ public:
     void updateIfNeeded(); // reads the file anew when its path, time or size has changed
 
 private:
-    std::mutex _mutex; // guards the following
-    std::string _stamp;
-    Dictionary _file;
+    Mutex _mutex;
+    std::string _stamp GUARDED_BY(_mutex);
+    Dictionary _file GUARDED_BY(_mutex);
 };
 
 } // namespace rolvane

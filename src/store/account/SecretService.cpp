@@ -1,11 +1,11 @@
 #include "store/account/SecretService.h"
 
 #include "foundation/CXException.h"
+#include "foundation/Mutex.h"
 
 #include <cstdlib>
 #include <libsecret/secret.h>
 #include <memory>
-#include <mutex>
 #include <thread>
 #include <unistd.h>
 #include <utility>
@@ -122,8 +122,8 @@ public:
 
 private:
     // The libraries keep one connection and one service for the whole process.
-    static std::mutex& turns() {
-        static auto* all = new std::mutex;
+    static Mutex& turns() {
+        static auto* all = new Mutex;
         return *all;
     }
     // Without an address the bus library would start a bus of its own.
@@ -134,7 +134,7 @@ private:
         return directory && *directory && access((std::string(directory) + "/bus").c_str(), F_OK) == 0;
     }
 
-    std::lock_guard<std::mutex> _turn;
+    Lock _turn;
     GMainContext* _context;
     Object<GCancellable> _cancellable;
     GSource* _watch;

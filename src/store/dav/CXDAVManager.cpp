@@ -2,6 +2,7 @@
 
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "foundation/Mutex.h"
 #include "foundation/Paths.h"
 #include "store/account/ConfigurationValues.h"
 #include "store/dav/CXDAVManagerImpl.h"
@@ -13,8 +14,8 @@ namespace rolvane {
 
 namespace {
 
-std::mutex sharedMutex;
-std::shared_ptr<CXDAVManager> sharedManager;
+Mutex sharedMutex;
+std::shared_ptr<CXDAVManager> sharedManager GUARDED_BY(sharedMutex);
 
 // The saved account, or an empty one, with which every operation fails.
 CXDAVAccount savedAccount() {
@@ -105,7 +106,7 @@ StoreFiles::Reading CXDAVManager::Impl::read(const Url& name, bool securely) {
 }
 
 StoreListing::AskedRef CXDAVManager::Impl::begun(const Url& container) {
-    const std::lock_guard guard(begunLock);
+    const Lock guard(begunLock);
     const auto found = begunListings.find(container.absoluteString());
     if (found == begunListings.end()) return nullptr;
     auto listing = std::move(found->second);
@@ -143,7 +144,7 @@ RequestFailures& CXDAVManager::failures() {
 // ---- the process's own
 
 static std::shared_ptr<CXDAVManager> shared() {
-    std::lock_guard guard(sharedMutex);
+    Lock guard(sharedMutex);
     if (!sharedManager) {
         sharedManager = std::make_shared<CXDAVManager>(savedAccount(), CXDAVManager::VersionsFile{versionMemoryPath()});
         // Now, when the TLS library has put its own end in the list: connections have to be closed before it goes.
@@ -157,7 +158,7 @@ CXDAVManager& CXDAVManager::defaultManager() {
 }
 
 void CXDAVManager::setDefaultManager(std::shared_ptr<CXDAVManager> manager) {
-    std::lock_guard guard(sharedMutex);
+    Lock guard(sharedMutex);
     std::swap(sharedManager, manager);
 }
 
@@ -284,7 +285,7 @@ void CXDAVManager::expectSomeReads(const std::vector<Url>& urls, bool securely) 
 
 void CXDAVManager::expectListing(const Url& url) {
     auto begun = StoreListing(_impl->session, _impl->versions, _impl->listings()).begin(url);
-    const std::lock_guard guard(_impl->begunLock);
+    const Lock guard(_impl->begunLock);
     _impl->begunListings.insert_or_assign(url.absoluteString(), std::move(begun));
 }
 
@@ -306,7 +307,7 @@ bool CXDAVManager::keepListing(const Url& tree, std::unique_ptr<ListingMemory> l
 
 void CXDAVManager::expectNothing() {
     _impl->files.expectNoReads();
-    const std::lock_guard guard(_impl->begunLock);
+    const Lock guard(_impl->begunLock);
     _impl->begunListings.clear();
 }
 
@@ -331,7 +332,7 @@ std::optional<CXDAVManager::TreeMark> CXDAVManager::markOfTree(const Url& tree, 
         StoreListing::AskedRef begun = _impl->begun(tree);
         if (!StoreListing(_impl->session, _impl->versions, _impl->listings()).bringUpToDate(tree, begun))
             return std::nullopt;
-        const std::lock_guard guard(_impl->begunLock);
+        const Lock guard(_impl->begunLock);
         _impl->begunListings.insert_or_assign(tree.absoluteString(), std::move(begun));
     }
     const uint64_t listing = _impl->listings().stateOf(tree);

@@ -1,5 +1,6 @@
 #pragma once
 
+#include "foundation/Mutex.h"
 #include "store/dav/CXDAVManager.h"
 #include "store/dav/StoreAccessLists.h"
 #include "store/files/PublishStructure.h"
@@ -12,7 +13,6 @@
 
 #include <atomic>
 #include <map>
-#include <mutex>
 
 namespace rolvane {
 
@@ -41,9 +41,9 @@ struct CXDAVManager::Impl {
     // looks after the tree's structure.
     StoreFiles::Reading read(const Url& name, bool securely);
 
-    std::mutex begunLock;
-    std::map<std::string, StoreListing::AskedRef> begunListings; // by container; guarded by begunLock
-    StoreListing::AskedRef begun(const Url& container);          // hands it out; null when there is none
+    Mutex begunLock;
+    std::map<std::string, StoreListing::AskedRef> begunListings GUARDED_BY(begunLock); // by container
+    StoreListing::AskedRef begun(const Url& container); // hands it out; null when there is none
 
 private:
     ListingMemory _listings;

@@ -1,6 +1,7 @@
 #include "store/dav/StoreAccessLists.h"
 
 #include "foundation/Log.h"
+#include "foundation/Mutex.h"
 #include "store/dav/Collections.h"
 #include "store/dav/StorePrincipals.h"
 
@@ -179,7 +180,7 @@ std::optional<AccessLists> StoreAccessLists::read(const Url& name, bool securely
     const auto found = fetch(*target);
     if (!found) return std::nullopt;
     AccessLists lists = listsOf(*found);
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     return _known[keyOf(name)] = std::move(lists);
 }
 
@@ -266,7 +267,7 @@ bool StoreAccessLists::set(const Url& name, bool securely, const AccessLists& as
         });
     std::optional<AccessLists> known;
     {
-        const std::lock_guard guard(_mutex);
+        const Lock guard(_mutex);
         if (const auto seen = _known.find(key); seen != _known.end()) known = seen->second;
     }
     if (known == wanted) return true;
@@ -283,7 +284,7 @@ bool StoreAccessLists::set(const Url& name, bool securely, const AccessLists& as
     const bool isThere = sameNames(next.readers, theirs.readers) && sameNames(next.writers, theirs.writers);
     if (!isThere && !sendOrInherit(name, *found, next)) return false;
     if (!complete) return false;
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     _known[key] = std::move(wanted);
     return true;
 }

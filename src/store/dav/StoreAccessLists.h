@@ -1,11 +1,11 @@
 #pragma once
 
+#include "foundation/Mutex.h"
 #include "foundation/Url.h"
 #include "store/dav/CXACE.h"
 #include "store/http/StoreSession.h"
 
 #include <map>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
@@ -56,8 +56,8 @@ private:
     bool sendOrInherit(const Url& name, OnStore& found, const AccessLists& wanted);
 
     StoreSession& _session;
-    std::mutex _mutex;                         // guards the following
-    std::map<std::string, AccessLists> _known; // by name: what the caller has seen or set last
+    Mutex _mutex;
+    std::map<std::string, AccessLists> _known GUARDED_BY(_mutex); // by name: what the caller has seen or set last
 };
 
 } // namespace rolvane

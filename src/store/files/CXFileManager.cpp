@@ -2,12 +2,12 @@
 
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "foundation/Mutex.h"
 #include "foundation/PropertyList.h"
 #include "store/dav/CXDAVManager.h"
 #include "store/files/LocalFiles.h"
 
 #include <cerrno>
-#include <mutex>
 #include <strings.h>
 
 namespace rolvane {
@@ -42,8 +42,8 @@ std::string fileAt(const LocalFiles& files, const Url& url) {
     return files.isDirectory(path) ? path + "/" + CXDAVManager::kStateName : path;
 }
 
-std::mutex handlerMutex;
-std::function<void()> passwordHandler;
+Mutex handlerMutex;
+std::function<void()> passwordHandler GUARDED_BY(handlerMutex);
 
 } // namespace
 
@@ -94,14 +94,14 @@ std::optional<FileListing> CXFileManager::infoForFilesInContainer(const Url& url
 }
 
 void CXFileManager::setFailedPasswordHandler(std::function<void()> handler) {
-    std::lock_guard guard(handlerMutex);
+    Lock guard(handlerMutex);
     passwordHandler = std::move(handler);
 }
 
 void CXFileManager::failedToGetPassword() {
     std::function<void()> handler;
     {
-        std::lock_guard guard(handlerMutex);
+        Lock guard(handlerMutex);
         handler = passwordHandler;
     }
     if (handler) handler();

@@ -1,6 +1,7 @@
 #include "store/files/PublishStructure.h"
 
 #include "foundation/Log.h"
+#include "foundation/Mutex.h"
 #include "foundation/Paths.h"
 #include "foundation/PropertyList.h"
 #include "store/dav/Collections.h"
@@ -63,7 +64,7 @@ PublishStructure::Missing PublishStructure::look(bool everything) {
 }
 
 bool PublishStructure::check(bool create) {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     return _isKnown = checkNow(create);
 }
 
@@ -95,7 +96,7 @@ bool PublishStructure::repair() {
 }
 
 void PublishStructure::keepSerialNumber(std::string serial) {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     _serial = std::move(serial);
 }
 

@@ -1,10 +1,10 @@
 #pragma once
 
+#include "foundation/Mutex.h"
 #include "store/files/StoreFiles.h"
 #include "store/http/StoreSession.h"
 
 #include <atomic>
-#include <mutex>
 
 namespace rolvane {
 
@@ -36,8 +36,8 @@ private:
         bool anything() const { return tree || people || dateFile || info || !buckets.empty(); }
     };
     Missing look(bool everything);
-    bool checkNow(bool create);
-    bool complete(const Missing& missing);
+    bool checkNow(bool create) REQUIRES(_mutex);
+    bool complete(const Missing& missing) REQUIRES(_mutex);
     bool makeTree();
     HttpRequest making(const Url& collection) const;
     HttpRequest writingNew(const Url& name, const std::string& text) const;
@@ -47,8 +47,8 @@ private:
 
     StoreSession& _session;
     StoreFiles& _files;
-    std::mutex _mutex; // one completion at a time; guards the following
-    std::string _serial;
+    Mutex _mutex; // one completion at a time
+    std::string _serial GUARDED_BY(_mutex);
     std::atomic<bool> _doubtful{false}, _isKnown{false}, _mendOnly{false};
 };
 

@@ -2,6 +2,7 @@
 
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "foundation/Mutex.h"
 #include "foundation/PropertyList.h"
 #include "foundation/TestSwitch.h"
 #include "store/dav/Collections.h"
@@ -148,7 +149,7 @@ bool StoreFiles::isReservedName(std::string_view name) {
 }
 
 bool StoreFiles::knownCollection(const Url& url) const {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     return !_collections.empty() && _collections.contains(url.absoluteString());
 }
 
@@ -157,13 +158,13 @@ Url StoreFiles::asKnown(const Url& url) const {
 }
 
 void StoreFiles::remember(const Url& url) {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     if (_collections.size() >= kMaxKnownCollections) _collections.clear();
     _collections.insert(url.absoluteString());
 }
 
 void StoreFiles::forget(const Url& url) {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     _collections.erase(url.absoluteString());
 }
 

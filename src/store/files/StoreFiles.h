@@ -1,5 +1,6 @@
 #pragma once
 
+#include "foundation/Mutex.h"
 #include "foundation/Value.h"
 #include "store/http/StoreSession.h"
 #include "store/locks/LockTokens.h"
@@ -9,7 +10,6 @@
 #include "store/reads/VersionMemory.h"
 
 #include <functional>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <unordered_set>
@@ -98,9 +98,9 @@ private:
     EarlyReads _early;
     ReadAhead _ahead;
     GroupCopies _copies;
-    const uint64_t _reader;                       // tells this object from every other one of the process
-    mutable std::mutex _mutex;                    // guards _collections
-    std::unordered_set<std::string> _collections; // endpoints known to be collections; a cache
+    const uint64_t _reader; // tells this object from every other one of the process
+    mutable Mutex _mutex;
+    std::unordered_set<std::string> _collections GUARDED_BY(_mutex); // endpoints known to be collections; a cache
 };
 
 } // namespace rolvane

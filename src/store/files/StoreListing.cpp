@@ -1,14 +1,13 @@
 #include "store/files/StoreListing.h"
 
 #include "foundation/Log.h"
+#include "foundation/Mutex.h"
 #include "store/dav/Collections.h"
 #include "store/files/StoreFiles.h"
 #include "store/files/SyncedListing.h"
 
 #include <algorithm>
-#include <condition_variable>
 #include <deque>
-#include <mutex>
 
 namespace rolvane {
 
@@ -48,24 +47,24 @@ struct StoreListing::Asked {
     std::vector<Url> containers;
     std::vector<std::shared_ptr<Staged>> staged;
     std::vector<HttpResponse> answers; // each written once, before its number stands among the arrived ones
-    std::mutex mutex;
-    std::condition_variable changed;
-    std::deque<size_t> arrived; // guarded by the mutex
-    bool isOfChanges = false;   // one answer, to the question what has changed
-    bool isOfToken = false;     // one answer, to the question for the token
-    bool isTakenIn = false;     // that answer is in the memory
+    Mutex mutex;
+    Condition changed;
+    std::deque<size_t> arrived GUARDED_BY(mutex);
+    bool isOfChanges = false; // one answer, to the question what has changed
+    bool isOfToken = false;   // one answer, to the question for the token
+    bool isTakenIn = false;   // that answer is in the memory
     std::optional<Date> serverDate;
 
     void arrive(size_t number, HttpResponse answer) {
-        const std::lock_guard guard(mutex);
+        const Lock guard(mutex);
         answers[number] = std::move(answer);
         arrived.push_back(number);
         changed.notify_all();
     }
     // Waits for another answer. As often as there are containers.
     size_t next() {
-        std::unique_lock lock(mutex);
-        changed.wait(lock, [&] { return !arrived.empty(); });
+        Lock lock(mutex);
+        changed.wait(lock, [&]() REQUIRES(mutex) { return !arrived.empty(); });
         const size_t number = arrived.front();
         arrived.pop_front();
         return number;

@@ -1,4 +1,5 @@
 #include "foundation/Date.h"
+#include "foundation/Mutex.h"
 #include "store/http/ConnectionRamp.h"
 #include "store/http/CurlDecisions.h"
 #include "store/http/CurlSlot.h"
@@ -7,8 +8,6 @@
 #include "store/http/KeptConnections.h"
 
 #include <algorithm>
-#include <condition_variable>
-#include <mutex>
 #include <set>
 #include <signal.h>
 #include <sys/epoll.h>
@@ -74,9 +73,9 @@ struct CurlTransport::Impl {
     CURLM* multi = nullptr;
     int epoll = -1, event = -1;
 
-    std::mutex inboxMutex; // guards inbox and credentials
-    std::vector<std::unique_ptr<HttpJob>> inbox;
-    std::shared_ptr<const TransportCredentials> credentials;
+    Mutex inboxMutex;
+    std::vector<std::unique_ptr<HttpJob>> inbox GUARDED_BY(inboxMutex);
+    std::shared_ptr<const TransportCredentials> credentials GUARDED_BY(inboxMutex);
     std::atomic<bool> sleeping{false}, stopping{false}, aborted{false}, connectionsAreStale{false};
     std::atomic<uint64_t> abortEpoch{0};
     std::atomic<uint64_t> requests{0}, connections{0}, challenged{0}, heldBackCount{0}, sentAnewCount{0};
@@ -160,7 +159,7 @@ void CurlTransport::Impl::enqueue(HttpRequest request, Completion done) {
         return fail(std::move(job), TransportError::refused, why);
     if (aborted || stopping) return fail(std::move(job), TransportError::aborted, "The program is ending.");
     {
-        std::lock_guard guard(inboxMutex);
+        Lock guard(inboxMutex);
         job->credentials = credentials;
         inbox.push_back(std::move(job));
     }
@@ -238,7 +237,7 @@ void CurlTransport::Impl::wait() {
     sleeping = true;
     int timeout = completed ? 0 : 60000;
     {
-        std::lock_guard guard(inboxMutex);
+        Lock guard(inboxMutex);
         if (!inbox.empty()) timeout = 0;
     }
     const auto until = [&](SteadyTime t) {
@@ -268,7 +267,7 @@ void CurlTransport::Impl::wait() {
 void CurlTransport::Impl::takeInbox() {
     std::vector<std::unique_ptr<HttpJob>> fresh;
     {
-        std::lock_guard guard(inboxMutex);
+        Lock guard(inboxMutex);
         fresh.swap(inbox);
     }
     if (!fresh.empty()) nextCheck = std::min(nextCheck, Steady::now() + kCheckPace);
@@ -489,19 +488,19 @@ CurlTransport::~CurlTransport() = default;
 
 HttpResponse CurlTransport::perform(HttpRequest request) {
     struct Waiting {
-        std::mutex mutex;
-        std::condition_variable changed;
-        std::optional<HttpResponse> answer;
+        Mutex mutex;
+        Condition changed;
+        std::optional<HttpResponse> answer GUARDED_BY(mutex);
     };
     auto waiting = std::make_shared<Waiting>();
     _impl->enqueue(std::move(request), [waiting](HttpResponse answer) {
-        std::lock_guard guard(waiting->mutex);
+        Lock guard(waiting->mutex);
         waiting->answer = std::move(answer);
         waiting->changed.notify_one();
     });
     // The transport's thread answers every request by its deadline.
-    std::unique_lock lock(waiting->mutex);
-    waiting->changed.wait(lock, [&] { return waiting->answer.has_value(); });
+    Lock lock(waiting->mutex);
+    waiting->changed.wait(lock, [&]() REQUIRES(waiting->mutex) { return waiting->answer.has_value(); });
     return std::move(*waiting->answer);
 }
 
@@ -526,7 +525,7 @@ void CurlTransport::networkChanged() {
 
 void CurlTransport::setCredentials(std::optional<TransportCredentials> credentials) {
     auto fresh = credentials ? std::make_shared<const TransportCredentials>(std::move(*credentials)) : nullptr;
-    std::lock_guard guard(_impl->inboxMutex);
+    Lock guard(_impl->inboxMutex);
     _impl->credentials = std::move(fresh);
 }
 

@@ -1,9 +1,9 @@
 #include "store/http/HttpTransport.h"
 
+#include "foundation/Mutex.h"
+
 #include <algorithm>
-#include <condition_variable>
 #include <cstdlib>
-#include <mutex>
 
 namespace rolvane {
 
@@ -38,22 +38,25 @@ std::optional<double> retryAfterSeconds(const HttpResponse& answer, const Date& 
 
 std::vector<HttpResponse> HttpTransport::performAll(std::vector<HttpRequest> requests) {
     struct Gathering {
-        std::mutex mutex;
-        std::condition_variable changed;
-        std::vector<HttpResponse> answers;
-        size_t missing;
+        Mutex mutex;
+        Condition changed;
+        std::vector<HttpResponse> answers GUARDED_BY(mutex);
+        size_t missing GUARDED_BY(mutex);
     };
     auto gathering = std::make_shared<Gathering>();
-    gathering->answers.resize(requests.size());
-    gathering->missing = requests.size();
+    {
+        const Lock guard(gathering->mutex);
+        gathering->answers.resize(requests.size());
+        gathering->missing = requests.size();
+    }
     for (size_t i = 0; i < requests.size(); ++i)
         start(std::move(requests[i]), [gathering, i](HttpResponse answer) {
-            std::lock_guard guard(gathering->mutex);
+            Lock guard(gathering->mutex);
             gathering->answers[i] = std::move(answer);
             if (--gathering->missing == 0) gathering->changed.notify_all();
         });
-    std::unique_lock lock(gathering->mutex);
-    gathering->changed.wait(lock, [&] { return gathering->missing == 0; });
+    Lock lock(gathering->mutex);
+    gathering->changed.wait(lock, [&]() REQUIRES(gathering->mutex) { return gathering->missing == 0; });
     return std::move(gathering->answers);
 }
 

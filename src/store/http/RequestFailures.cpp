@@ -1,6 +1,7 @@
 #include "store/http/RequestFailures.h"
 
 #include "foundation/Date.h"
+#include "foundation/Mutex.h"
 #include "foundation/Utf8.h"
 
 #include <algorithm>
@@ -177,7 +178,7 @@ void RequestFailures::note(std::string method, Url name, const HttpResponse& ans
 void RequestFailures::note(RequestFailure failure) {
     std::string kind = treeOf(failure.name) + " " + failure.method + " " + std::to_string(failure.status) + " " +
                        std::to_string(static_cast<int>(failure.error));
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     if (_kinds.size() >= kKinds && !_kinds.contains(kind)) kind = kOverflow;
     Kept& kept = _kinds[kind];
     Numbered numbered{++_noted, std::move(failure)};
@@ -189,7 +190,7 @@ void RequestFailures::note(RequestFailure failure) {
 std::vector<RequestFailure> RequestFailures::take() {
     std::map<std::string, Kept> kinds;
     {
-        const std::lock_guard guard(_mutex);
+        const Lock guard(_mutex);
         kinds.swap(_kinds);
     }
     std::vector<Numbered> all;
@@ -215,7 +216,7 @@ std::optional<RequestFailure> RequestFailures::latestBelow(const Url& baseName) 
     const auto look = [&](const Numbered& one) {
         if ((!latest || one.number > latest->number) && isBelow(one.failure.name)) latest = &one;
     };
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     for (const auto& [kind, kept] : _kinds) {
         for (const Numbered& one : kept.first) look(one);
         for (const Numbered& one : kept.last) look(one);

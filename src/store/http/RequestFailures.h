@@ -1,12 +1,12 @@
 #pragma once
 
+#include "foundation/Mutex.h"
 #include "foundation/Url.h"
 #include "store/http/HttpTransport.h"
 
 #include <cstdint>
 #include <deque>
 #include <map>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
@@ -53,9 +53,9 @@ private:
         std::vector<Numbered> first;
         std::deque<Numbered> last;
     };
-    mutable std::mutex _mutex; // guards the following
-    std::map<std::string, Kept> _kinds;
-    uint64_t _noted = 0;
+    mutable Mutex _mutex;
+    std::map<std::string, Kept> _kinds GUARDED_BY(_mutex);
+    uint64_t _noted GUARDED_BY(_mutex) = 0;
 };
 
 } // namespace rolvane

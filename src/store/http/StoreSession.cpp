@@ -2,6 +2,7 @@
 
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "foundation/Mutex.h"
 #include "foundation/SignOfLife.h"
 #include "foundation/TestSwitch.h"
 #include "store/dav/Collections.h"
@@ -151,7 +152,7 @@ HttpRequest StoreSession::propfind(Url url, int depth, bool withMembersTags) {
 }
 
 std::optional<std::string> StoreSession::password() {
-    std::unique_lock lock(_mutex);
+    Lock lock(_mutex);
     if (!_password || _loginRefused) {
         try {
             _password = _account.password();
@@ -191,7 +192,7 @@ HttpResponse StoreSession::followed(const HttpRequest& asked, HttpResponse answe
 
 HttpResponse StoreSession::believed(const HttpRequest& asked, HttpResponse answer) {
     if (answer.status == 401) {
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         _loginRefused = true;
         _loginProven = false;
     }
@@ -324,7 +325,7 @@ void StoreSession::heedNews(const HttpResponse& answer) {
     const std::string* offered = answer.header("rolvane-news");
     const size_t blank = offered ? offered->find(' ') : std::string::npos;
     const auto base = collectionEndpoint(_account.baseLocationFor(_account.user));
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     const bool isUsable = blank != std::string::npos && offered->size() <= kLongest && offered->starts_with('/') &&
                           !offered->starts_with("//") && base;
     if (!isUsable) {
@@ -336,7 +337,7 @@ void StoreSession::heedNews(const HttpResponse& answer) {
 }
 
 std::optional<StoreSession::NewsOffer> StoreSession::newsOffer() {
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     return _news;
 }
 
@@ -427,7 +428,7 @@ bool StoreSession::canReach(CXDAVError& error, const std::function<void()>& mean
     error = {};
     bool needsLoginProof;
     {
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         if (_loginRefused) _signedIn = false; // the password may have been corrected meanwhile
         needsLoginProof = !_loginProven;
     }
@@ -449,11 +450,11 @@ bool StoreSession::canReach(CXDAVError& error, const std::function<void()>& mean
         const char* asked = i == 0 ? "OPTIONS" : "PROPFIND";
         error = errorFrom(answer, asked);
         noteFailure(asked, collectionEndpoint(_account.baseLocationFor(_account.user)).value_or(Url()), answer);
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         _loginRefused = _loginRefused || answer.status == 401;
         return false;
     }
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     _loginProven = true;
     _loginRefused = false;
     return true;

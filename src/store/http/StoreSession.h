@@ -1,5 +1,6 @@
 #pragma once
 
+#include "foundation/Mutex.h"
 #include "store/account/Account.h"
 #include "store/dav/CXDAVManager.h"
 #include "store/http/HttpTransport.h"
@@ -9,7 +10,6 @@
 #include <chrono>
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -112,11 +112,11 @@ private:
 
     RequestFailures _failures;
 
-    std::mutex _mutex; // guards the following
-    std::optional<std::string> _password;
-    bool _loginRefused = false; // a 401 was seen: ask for the password anew
-    std::optional<NewsOffer> _news;
-    bool _loginProven = false; // a request that needs a login has succeeded
+    Mutex _mutex;
+    std::optional<std::string> _password GUARDED_BY(_mutex);
+    bool _loginRefused GUARDED_BY(_mutex) = false; // a 401 was seen: ask for the password anew
+    std::optional<NewsOffer> _news GUARDED_BY(_mutex);
+    bool _loginProven GUARDED_BY(_mutex) = false; // a request that needs a login has succeeded
     std::atomic<bool> _signedIn{false};
     std::atomic<bool> _membersTags{false};
     std::atomic<bool> _syncs{false};

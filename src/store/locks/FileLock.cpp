@@ -1,3 +1,4 @@
+#include "foundation/Mutex.h"
 #include "foundation/Paths.h"
 #include "store/locks/CXWebDAVLock.h"
 
@@ -5,7 +6,6 @@
 #include <cstdio>
 #include <cstdlib>
 #include <fcntl.h>
-#include <mutex>
 #include <string>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -22,20 +22,20 @@ public:
     FileLock(const Url& url, Clock& clock) : _url(url), _path(url.path()), _clock(clock), _nonce(makeUUID()) {}
 
     bool tryLock() override {
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         if (_held) return true;
         if (!appear() && !(clearExpired() && appear())) return false;
         return _held = true;
     }
 
     void unlock() override {
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         if (_held && owner() == _nonce) ::unlink(_path.c_str());
         _held = false;
     }
 
     bool renew() override {
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         if (!_held) return false;
         const std::string fresh = _path + "." + _nonce;
         const Date until = _clock.now().addingSeconds(lockTimeout());
@@ -49,19 +49,19 @@ public:
     }
 
     bool locked() const override {
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         return _held;
     }
 
     Date expires() const override {
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         return _held ? _expires : _clock.now().addingSeconds(lockTimeout());
     }
 
     const Url& url() const override { return _url; }
 
 private:
-    bool appear() {
+    bool appear() REQUIRES(_mutex) {
         const std::string fresh = _path + "." + _nonce;
         const Date until = _clock.now().addingSeconds(lockTimeout());
         if (!writeText(fresh, until)) return false;
@@ -120,9 +120,9 @@ private:
     const std::string _path;
     Clock& _clock;
     const std::string _nonce;
-    mutable std::mutex _mutex; // guards the following
-    bool _held = false;
-    Date _expires;
+    mutable Mutex _mutex;
+    bool _held GUARDED_BY(_mutex) = false;
+    Date _expires GUARDED_BY(_mutex);
 };
 
 } // namespace

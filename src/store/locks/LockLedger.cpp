@@ -2,6 +2,7 @@
 
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "foundation/Mutex.h"
 #include "foundation/Paths.h"
 #include "store/locks/CXWebDAVLock.h"
 
@@ -9,7 +10,6 @@
 #include <cstdio>
 #include <filesystem>
 #include <map>
-#include <mutex>
 #include <sstream>
 #include <unistd.h>
 
@@ -93,10 +93,10 @@ std::string LockLedger::pathForRun(const std::string& mark) const {
 }
 
 std::string LockLedger::markOfThisRun() const {
-    static std::mutex mutex;
+    static Mutex mutex;
     static std::map<std::pair<pid_t, std::string>, std::string> marks; // of a process that forked, too
     if (_directory.empty()) return {};
-    const std::lock_guard guard(mutex);
+    const Lock guard(mutex);
     std::string& mark = marks[{getpid(), _directory}];
     if (!mark.empty() && access(pathForRun(mark).c_str(), R_OK) == 0) return mark;
     try {

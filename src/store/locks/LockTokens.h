@@ -1,11 +1,11 @@
 #pragma once
 
+#include "foundation/Mutex.h"
 #include "foundation/StrongString.h"
 
 #include <algorithm>
 #include <deque>
 #include <map>
-#include <mutex>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -18,41 +18,41 @@ namespace rolvane {
 class LockTokens {
 public:
     LockToken tokenFor(const std::string& url) const {
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         const auto found = _tokens.find(url);
         return found == _tokens.end() ? LockToken() : found->second;
     }
     void set(const std::string& url, const LockToken& token) {
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         _tokens[url] = token;
         _abandoned.erase(url);
         if (const auto found = _unheard.find(url); found != _unheard.end()) found->second.toBeLookedFor = false;
     }
     void drop(const std::string& url, const LockToken& token) {
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         const auto found = _tokens.find(url);
         if (found != _tokens.end() && found->second == token) _tokens.erase(found);
     }
     // The same as `drop`, and the lock may still stand on the store.
     void abandon(const std::string& url, const LockToken& token) {
         drop(url, token);
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         _abandoned[url] = token;
     }
     LockToken abandonedFor(const std::string& url) const {
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         const auto found = _abandoned.find(url);
         return found == _abandoned.end() ? LockToken() : found->second;
     }
     void forgetAbandoned(const std::string& url) {
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         _abandoned.erase(url);
     }
 
     // A lock whose owner carries the mark may stand, though no answer has told of it.
     void expectUnheard(const std::string& url, const std::string& mark) {
         constexpr size_t kKept = 16; // a URL's; older locks have come to their end
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         Unheard& unheard = _unheard[url];
         unheard.marks.push_back(mark);
         if (unheard.marks.size() > kKept) unheard.marks.pop_front();
@@ -60,7 +60,7 @@ public:
     }
     // Whether the owner of a lock that stands there carries such a mark.
     bool isUnheard(const std::string& url, std::string_view owner) const {
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         const auto found = _unheard.find(url);
         if (found == _unheard.end()) return false;
         const auto& marks = found->second.marks;
@@ -69,18 +69,18 @@ public:
     }
     // The store has said that no such lock stands. A request may still be on its way, so the marks are kept.
     void lookedForUnheard(const std::string& url) {
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         if (const auto found = _unheard.find(url); found != _unheard.end()) found->second.toBeLookedFor = false;
     }
 
     // Whether, and where, the store may keep a lock of ours that nobody here holds.
     bool isLeftBehind(const std::string& url) const {
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         const auto found = _unheard.find(url);
         return _abandoned.contains(url) || (found != _unheard.end() && found->second.toBeLookedFor);
     }
     std::vector<std::string> leftBehind() const {
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         std::vector<std::string> urls;
         for (const auto& [url, token] : _abandoned) urls.push_back(url);
         for (const auto& [url, unheard] : _unheard)
@@ -90,11 +90,11 @@ public:
 
     // A store that has shown that it keeps no locks there is not asked for one until then (seconds since boot).
     void needNone(const std::string& url, double until) {
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         _noneNeeded[url] = until;
     }
     bool needsNone(const std::string& url, double now) const {
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         const auto found = _noneNeeded.find(url);
         return found != _noneNeeded.end() && now < found->second;
     }
@@ -104,10 +104,10 @@ private:
         std::deque<std::string> marks;
         bool toBeLookedFor = false;
     };
-    mutable std::mutex _mutex;
-    std::map<std::string, LockToken> _tokens, _abandoned;
-    std::map<std::string, Unheard> _unheard;
-    std::map<std::string, double> _noneNeeded;
+    mutable Mutex _mutex;
+    std::map<std::string, LockToken> _tokens GUARDED_BY(_mutex), _abandoned GUARDED_BY(_mutex);
+    std::map<std::string, Unheard> _unheard GUARDED_BY(_mutex);
+    std::map<std::string, double> _noneNeeded GUARDED_BY(_mutex);
 };
 
 } // namespace rolvane

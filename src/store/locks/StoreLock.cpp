@@ -2,6 +2,7 @@
 
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "foundation/Mutex.h"
 #include "foundation/Paths.h"
 #include "store/dav/CXDAVManagerImpl.h"
 #include "store/dav/CXDAVNode.h"
@@ -161,7 +162,7 @@ bool StoreLock::keep(const LockGrant& grant) {
     if (!isPlausible(grant.token)) return false;
     const double seconds = std::clamp(grant.timeoutSeconds.value_or(lockTimeout()), 1.0, 86400.0);
     {
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         _token = grant.token;
         _ends = secondsSinceBoot() + seconds;
     }
@@ -174,7 +175,7 @@ bool StoreLock::keep(const LockGrant& grant) {
 void StoreLock::lose(bool gone) {
     LockToken token;
     {
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         std::swap(token, _token);
     }
     if (token.empty() || !_endpoint) return;
@@ -262,7 +263,7 @@ StoreLock::Had StoreLock::attempt(CXDAVManager::Impl& client, const std::optiona
 }
 
 bool StoreLock::tryLock() {
-    std::lock_guard calls(_calls);
+    Lock calls(_calls);
     if (locked()) return true;
     const auto client = _client.lock();
     if (!_endpoint || !client) return false;
@@ -274,7 +275,7 @@ bool StoreLock::tryLock() {
     if (had == Had::lock) {
         LockToken token;
         {
-            std::lock_guard guard(_mutex);
+            Lock guard(_mutex);
             token = _token;
         }
         _ledger.note(where, token);
@@ -287,10 +288,10 @@ bool StoreLock::tryLock() {
 
 // Asked twice where no answer comes, as `unlock` does.
 bool StoreLock::renew() {
-    std::lock_guard calls(_calls);
+    Lock calls(_calls);
     LockToken token;
     {
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         token = _token;
     }
     if (token.empty()) return false;
@@ -303,10 +304,10 @@ bool StoreLock::renew() {
 }
 
 void StoreLock::unlock() {
-    std::lock_guard calls(_calls);
+    Lock calls(_calls);
     LockToken token;
     {
-        std::lock_guard guard(_mutex);
+        Lock guard(_mutex);
         token = _token;
     }
     const auto client = _client.lock();
@@ -318,12 +319,12 @@ void StoreLock::unlock() {
 }
 
 bool StoreLock::locked() const {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     return !_token.empty();
 }
 
 Date StoreLock::expires() const {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     return _clock.now().addingSeconds(_token.empty() ? lockTimeout() : _ends - secondsSinceBoot());
 }
 

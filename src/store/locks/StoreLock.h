@@ -1,12 +1,12 @@
 #pragma once
 
+#include "foundation/Mutex.h"
 #include "store/dav/CXDAVManager.h"
 #include "store/dav/Multistatus.h"
 #include "store/locks/CXWebDAVLock.h"
 #include "store/locks/LockLedger.h"
 
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 
@@ -45,10 +45,10 @@ private:
     std::optional<Url> _endpoint;
     LockLedger _ledger;
     const Clock& _clock;
-    std::mutex _calls;         // one call at a time
-    mutable std::mutex _mutex; // guards the following
-    LockToken _token;
-    double _ends = 0; // seconds since boot
+    Mutex _calls; // one call at a time
+    mutable Mutex _mutex;
+    LockToken _token GUARDED_BY(_mutex);
+    double _ends GUARDED_BY(_mutex) = 0; // seconds since boot
 };
 
 } // namespace rolvane

@@ -1,8 +1,8 @@
 #include "store/reads/EarlyReads.h"
 
-#include <condition_variable>
+#include "foundation/Mutex.h"
+
 #include <deque>
-#include <mutex>
 #include <unordered_map>
 
 namespace rolvane {
@@ -17,16 +17,15 @@ struct EarlyReads::Shelf {
     explicit Shelf(ReadAhead::Start s) : start(std::move(s)) {}
 
     const ReadAhead::Start start;
-    std::mutex mutex;
-    std::condition_variable changed;
-    // The following are guarded by the mutex.
-    std::unordered_map<std::string, PlaceRef> places;
-    std::deque<std::string> toBegin; // some of them may be gone from the places
-    size_t underWay = 0, waitingBytes = 0;
-    bool refilling = false;
+    Mutex mutex;
+    Condition changed;
+    std::unordered_map<std::string, PlaceRef> places GUARDED_BY(mutex);
+    std::deque<std::string> toBegin GUARDED_BY(mutex); // some of them may be gone from the places
+    size_t underWay GUARDED_BY(mutex) = 0, waitingBytes GUARDED_BY(mutex) = 0;
+    bool refilling GUARDED_BY(mutex) = false;
 
     // The next one that there is room for.
-    std::optional<std::pair<std::string, PlaceRef>> next() {
+    std::optional<std::pair<std::string, PlaceRef>> next() REQUIRES(mutex) {
         while (!toBegin.empty() && underWay < kUnderWay && waitingBytes < kWaitingBytes) {
             std::string url = std::move(toBegin.front());
             toBegin.pop_front();
@@ -39,16 +38,16 @@ struct EarlyReads::Shelf {
         return std::nullopt;
     }
     // Nobody is going to take it, or somebody has.
-    void drop(std::unordered_map<std::string, PlaceRef>::iterator found) {
+    void drop(std::unordered_map<std::string, PlaceRef>::iterator found) REQUIRES(mutex) {
         if (found->second->arrived) waitingBytes -= found->second->answer.body.size();
         places.erase(found);
     }
-    bool stands(const std::string& url, const PlaceRef& place) const {
+    bool stands(const std::string& url, const PlaceRef& place) const REQUIRES(mutex) {
         const auto found = places.find(url);
         return found != places.end() && found->second == place;
     }
     void arrive(const std::string& url, const PlaceRef& place, HttpResponse answer) {
-        const std::lock_guard guard(mutex);
+        const Lock guard(mutex);
         --underWay;
         place->arrived = true;
         if (stands(url, place)) {
@@ -63,7 +62,7 @@ EarlyReads::EarlyReads(ReadAhead::Start start) : _shelf(std::make_shared<Shelf>(
 
 // Requests are started without the lock: an answer may come before `start` returns, and refills then.
 void EarlyReads::refill(const std::shared_ptr<Shelf>& shelf) {
-    for (std::unique_lock lock(shelf->mutex);;) {
+    for (Lock lock(shelf->mutex);;) {
         if (shelf->refilling) return; // whoever does it looks again
         auto begun = shelf->next();
         if (!begun) return;
@@ -81,7 +80,7 @@ void EarlyReads::refill(const std::shared_ptr<Shelf>& shelf) {
 
 void EarlyReads::add(const std::vector<Url>& urls) {
     {
-        const std::lock_guard guard(_shelf->mutex);
+        const Lock guard(_shelf->mutex);
         for (const Url& url : urls) {
             if (_shelf->places.size() >= kHeld) break;
             const auto [found, isNew] = _shelf->places.try_emplace(url.absoluteString());
@@ -94,7 +93,7 @@ void EarlyReads::add(const std::vector<Url>& urls) {
 }
 
 bool EarlyReads::claim(const Url& url) {
-    const std::lock_guard guard(_shelf->mutex);
+    const Lock guard(_shelf->mutex);
     const auto found = _shelf->places.find(url.absoluteString());
     if (found == _shelf->places.end()) return false;
     if (found->second->begun) return true;
@@ -105,12 +104,14 @@ bool EarlyReads::claim(const Url& url) {
 std::optional<HttpResponse> EarlyReads::take(const Url& url) {
     std::optional<HttpResponse> answer;
     {
-        std::unique_lock lock(_shelf->mutex);
+        Lock lock(_shelf->mutex);
         const std::string& name = url.absoluteString();
         auto found = _shelf->places.find(name);
         if (found == _shelf->places.end()) return std::nullopt;
         const Shelf::PlaceRef place = found->second;
-        if (place->begun) _shelf->changed.wait(lock, [&] { return place->arrived || !_shelf->stands(name, place); });
+        if (place->begun)
+            _shelf->changed.wait(
+                lock, [&]() REQUIRES(_shelf->mutex) { return place->arrived || !_shelf->stands(name, place); });
         if (!_shelf->stands(name, place)) return std::nullopt;
         found = _shelf->places.find(name);
         HttpResponse arrived = place->answer;
@@ -123,14 +124,14 @@ std::optional<HttpResponse> EarlyReads::take(const Url& url) {
 }
 
 void EarlyReads::forget(const Url& url) {
-    const std::lock_guard guard(_shelf->mutex);
+    const Lock guard(_shelf->mutex);
     const auto found = _shelf->places.find(url.absoluteString());
     if (found != _shelf->places.end()) _shelf->drop(found);
     _shelf->changed.notify_all();
 }
 
 void EarlyReads::clear() {
-    const std::lock_guard guard(_shelf->mutex);
+    const Lock guard(_shelf->mutex);
     _shelf->places.clear();
     _shelf->toBegin.clear();
     _shelf->waitingBytes = 0;

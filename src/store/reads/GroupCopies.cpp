@@ -1,6 +1,7 @@
 #include "store/reads/GroupCopies.h"
 
 #include "foundation/CXException.h"
+#include "foundation/Mutex.h"
 #include "store/reads/CacheText.h"
 
 #include <utility>
@@ -9,7 +10,7 @@ namespace rolvane {
 
 void GroupCopies::keep(const std::string& name, const Dictionary& content) {
     Dictionary own = Value(content).deepMutableCopy().dictionary();
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     if (_copies.size() >= kMostGroups && !_copies.contains(name)) _copies.erase(_copies.begin());
     _copies.insert_or_assign(name, std::move(own));
     _former.erase(name);
@@ -18,13 +19,13 @@ void GroupCopies::keep(const std::string& name, const Dictionary& content) {
 }
 
 void GroupCopies::forget(const std::string& name) {
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     _hasChanged = _copies.erase(name) + _former.erase(name) > 0 || _hasChanged;
     _unchanged.erase(name);
 }
 
 void GroupCopies::forgetAll() {
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     _copies.clear();
     _former.clear();
     _unchanged.clear();
@@ -32,19 +33,19 @@ void GroupCopies::forgetAll() {
 }
 
 void GroupCopies::beginSnapshot() {
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     _unchanged.clear();
     _inSnapshot = true;
 }
 
 void GroupCopies::endSnapshot() {
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     _unchanged.clear();
     _inSnapshot = false;
 }
 
 void GroupCopies::foundUnchanged(const std::string& name, uint64_t version) {
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     if (!_inSnapshot) return;
     if (!_former.empty()) takeFormer(name, version);
     _unchanged.insert(name);
@@ -66,14 +67,14 @@ void GroupCopies::takeFormer(const std::string& name, uint64_t version) {
 }
 
 std::optional<Dictionary> GroupCopies::unchanged(const std::string& name) const {
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     const auto copy = _copies.find(name);
     if (copy == _copies.end() || !_unchanged.contains(name)) return std::nullopt;
     return Value(copy->second).deepMutableCopy().dictionary();
 }
 
 std::string GroupCopies::saved(const VersionOf& versionOf) const {
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     std::string out;
     const auto add = [&](const std::string& name, uint64_t version, std::string_view content) {
         cacheAppend(out, std::string_view(name));
@@ -92,7 +93,7 @@ std::string GroupCopies::saved(const VersionOf& versionOf) const {
 }
 
 void GroupCopies::restore(std::string text) {
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     _formerText = std::move(text);
     for (CacheReader in(_formerText); !in.atEnd();) {
         const std::string name(in.text());
@@ -105,7 +106,7 @@ void GroupCopies::restore(std::string text) {
 }
 
 bool GroupCopies::hasChanged() const {
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     return _hasChanged;
 }
 

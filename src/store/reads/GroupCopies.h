@@ -1,11 +1,11 @@
 #pragma once
 
 #include "foundation/BinaryValue.h"
+#include "foundation/Mutex.h"
 #include "foundation/Value.h"
 
 #include <cstddef>
 #include <functional>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <unordered_map>
@@ -44,15 +44,15 @@ private:
         uint64_t version;
         size_t at, size; // of the content in _formerText
     };
-    void takeFormer(const std::string& name, uint64_t version); // with the lock held
+    void takeFormer(const std::string& name, uint64_t version) REQUIRES(_mutex);
 
-    mutable std::mutex _mutex; // guards the following
-    std::unordered_map<std::string, Dictionary> _copies;
-    std::unordered_set<std::string> _unchanged;
-    bool _inSnapshot = false;
-    std::string _formerText;
-    std::unordered_map<std::string, Former> _former; // not decoded yet
-    bool _hasChanged = false;
+    mutable Mutex _mutex;
+    std::unordered_map<std::string, Dictionary> _copies GUARDED_BY(_mutex);
+    std::unordered_set<std::string> _unchanged GUARDED_BY(_mutex);
+    bool _inSnapshot GUARDED_BY(_mutex) = false;
+    std::string _formerText GUARDED_BY(_mutex);
+    std::unordered_map<std::string, Former> _former GUARDED_BY(_mutex); // not decoded yet
+    bool _hasChanged GUARDED_BY(_mutex) = false;
 };
 
 } // namespace rolvane

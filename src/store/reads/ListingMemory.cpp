@@ -1,5 +1,6 @@
 #include "store/reads/ListingMemory.h"
 
+#include "foundation/Mutex.h"
 #include "store/reads/CacheText.h"
 
 #include <algorithm>
@@ -48,7 +49,7 @@ void ListingMemory::keep(const Url& container, const std::string& tag, const Ent
     Container fresh;
     if (!tag.empty()) fresh = packed(entries);
     fresh.tag = tag;
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     if (const auto old = _containers.find(container.absoluteString()); old != _containers.end()) {
         _bytes -= old->second.bytes();
         _containers.erase(old);
@@ -64,7 +65,7 @@ void ListingMemory::keep(const Url& container, const std::string& tag, const Ent
 }
 
 void ListingMemory::forgetAll() {
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     _containers.clear();
     _tokens.clear();
     _bytes = 0;
@@ -73,9 +74,9 @@ void ListingMemory::forgetAll() {
 
 void ListingMemory::forgetBelow(const Url& container) {
     const std::string& place = container.absoluteString();
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     _tokens.erase(place);
-    std::erase_if(_containers, [&](const auto& each) {
+    std::erase_if(_containers, [&](const auto& each) REQUIRES(_mutex) {
         const bool goes = isBelow(each.first, place);
         if (goes) _bytes -= each.second.bytes();
         return goes;
@@ -87,7 +88,7 @@ void ListingMemory::takeOver(const Url& tree, ListingMemory&& from) {
     if (token.empty() || !this->token(tree).empty()) return;
     forgetBelow(tree);
     {
-        const std::scoped_lock guard(_mutex, from._mutex);
+        const Lock guard(_mutex), guardOfOther(from._mutex); // nobody else has the other one
         if (_bytes + from._bytes > kMostBytes) return;
         _bytes += std::exchange(from._bytes, 0);
         _containers.merge(from._containers);
@@ -96,7 +97,7 @@ void ListingMemory::takeOver(const Url& tree, ListingMemory&& from) {
 }
 
 void ListingMemory::keepToken(const Url& tree, const std::string& token, bool isAnother) {
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     const auto [found, isNew] = _tokens.try_emplace(tree.absoluteString());
     Synced& synced = found->second;
     _isNew = _isNew || isNew;
@@ -106,13 +107,13 @@ void ListingMemory::keepToken(const Url& tree, const std::string& token, bool is
 }
 
 uint64_t ListingMemory::stateOf(const Url& tree) const {
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     const auto found = _tokens.find(tree.absoluteString());
     return found == _tokens.end() ? 0 : found->second.state;
 }
 
 void ListingMemory::noteChanges(size_t members) {
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     _changes += members;
 }
 
@@ -123,18 +124,18 @@ size_t ListingMemory::members() const {
 }
 
 bool ListingMemory::isWorthSaving(bool atEnd) const {
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     return _isNew || (atEnd && _changes > 0) || (_changes > kFewChanges && _changes > members() / 10);
 }
 
 void ListingMemory::wasSaved() {
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     _isNew = false;
     _changes = 0;
 }
 
 std::string ListingMemory::saved() const {
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     std::string out;
     out.reserve(_bytes + (_bytes >> 3));
     for (const auto& [tree, synced] : _tokens) {
@@ -197,7 +198,7 @@ bool ListingMemory::restore(std::string_view text) {
         }
         if (!in.isWhole() || tokens[tree].token.empty()) return false;
     }
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     if (!_containers.empty() || !_tokens.empty() || bytes > kMostBytes) return false;
     for (auto& [tree, synced] : tokens) synced.state = ++_lastState;
     _containers = std::move(containers);
@@ -207,13 +208,13 @@ bool ListingMemory::restore(std::string_view text) {
 }
 
 std::string ListingMemory::token(const Url& tree) const {
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     const auto found = _tokens.find(tree.absoluteString());
     return found == _tokens.end() ? std::string() : found->second.token;
 }
 
 bool ListingMemory::has(const Url& container, const std::string& tag) const {
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     const auto found = _containers.find(container.absoluteString());
     return found != _containers.end() && found->second.tag == tag;
 }

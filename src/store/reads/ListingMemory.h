@@ -1,11 +1,11 @@
 #pragma once
 
+#include "foundation/Mutex.h"
 #include "store/dav/Multistatus.h"
 
 #include "foundation/Url.h"
 
 #include <cstdint>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -62,7 +62,7 @@ public:
     // name lives for the time of the call.
     template <class Take>
     bool forEach(const Url& container, const std::string& tag, Take take) const {
-        const std::lock_guard guard(_mutex);
+        const Lock guard(_mutex);
         const auto found = _containers.find(container.absoluteString());
         if (tag.empty() || found == _containers.end() || found->second.tag != tag) return false;
         for (const Row& row : found->second.rows) take(unpacked(found->second, row));
@@ -83,20 +83,20 @@ private:
     };
     static Member unpacked(const Container& container, const Row& row);
     static Container packed(const Entries& entries);
-    size_t members() const; // with the lock held
+    size_t members() const REQUIRES(_mutex);
 
-    mutable std::mutex _mutex; // guards the following
-    std::unordered_map<std::string, Container> _containers;
+    mutable Mutex _mutex;
+    std::unordered_map<std::string, Container> _containers GUARDED_BY(_mutex);
     struct Synced {
         std::string token;
         uint64_t state = 0;
         bool isUsed = false; // the store has given the token in this process
     };
-    std::unordered_map<std::string, Synced> _tokens; // by tree
-    uint64_t _lastState = 0;
-    size_t _bytes = 0;
-    size_t _changes = 0; // members that have changed since it was saved
-    bool _isNew = false; // a tree has come that is in no file
+    std::unordered_map<std::string, Synced> _tokens GUARDED_BY(_mutex); // by tree
+    uint64_t _lastState GUARDED_BY(_mutex) = 0;
+    size_t _bytes GUARDED_BY(_mutex) = 0;
+    size_t _changes GUARDED_BY(_mutex) = 0; // members that have changed since it was saved
+    bool _isNew GUARDED_BY(_mutex) = false; // a tree has come that is in no file
 };
 
 } // namespace rolvane

@@ -1,6 +1,6 @@
 #include "store/reads/ReadAhead.h"
 
-#include <condition_variable>
+#include "foundation/Mutex.h"
 
 namespace rolvane {
 
@@ -14,28 +14,29 @@ HttpRequest ReadAhead::getting(const std::string& url) {
 }
 
 struct ReadAhead::Window {
-    std::mutex mutex;
-    std::condition_variable changed;
-    // The following are guarded by the mutex.
+    Mutex mutex;
+    Condition changed;
     struct Place {
         bool arrived = false;
         HttpResponse answer;
     };
-    std::vector<std::string> urls;
-    std::unordered_map<std::string, size_t> positions;
-    std::unordered_map<size_t, Place> places; // from `first` to `next`: under way or waiting
-    size_t first = 0, next = 0;
-    size_t waitingBytes = 0;
+    std::vector<std::string> urls GUARDED_BY(mutex);
+    std::unordered_map<std::string, size_t> positions GUARDED_BY(mutex);
+    std::unordered_map<size_t, Place> places GUARDED_BY(mutex); // from `first` to `next`: under way or waiting
+    size_t first GUARDED_BY(mutex) = 0, next GUARDED_BY(mutex) = 0;
+    size_t waitingBytes GUARDED_BY(mutex) = 0;
 
-    bool mayStart() const { return next < urls.size() && places.size() < kWindow && waitingBytes < kWaitingBytes; }
-    void drop(size_t position) {
+    bool mayStart() const REQUIRES(mutex) {
+        return next < urls.size() && places.size() < kWindow && waitingBytes < kWaitingBytes;
+    }
+    void drop(size_t position) REQUIRES(mutex) {
         const auto place = places.find(position);
         if (place == places.end()) return;
         if (place->second.arrived) waitingBytes -= place->second.answer.body.size();
         places.erase(place);
     }
     void arrive(size_t position, HttpResponse answer) {
-        const std::lock_guard guard(mutex);
+        const Lock guard(mutex);
         const auto place = places.find(position);
         if (place == places.end()) return; // nobody waits for it any more
         place->second.arrived = true;
@@ -49,19 +50,20 @@ void ReadAhead::expect(const std::vector<Url>& urls) {
     std::shared_ptr<Window> window;
     if (!urls.empty()) {
         window = std::make_shared<Window>();
+        const Lock guard(window->mutex);
         for (const Url& url : urls)
             if (window->positions.emplace(url.absoluteString(), window->urls.size()).second)
                 window->urls.push_back(url.absoluteString());
     }
     {
-        const std::lock_guard guard(_mutex);
+        const Lock guard(_mutex);
         _window = window;
     }
     if (window) refill(window);
 }
 
 std::shared_ptr<ReadAhead::Window> ReadAhead::current() {
-    const std::lock_guard guard(_mutex);
+    const Lock guard(_mutex);
     return _window;
 }
 
@@ -71,7 +73,7 @@ void ReadAhead::refill(const std::shared_ptr<Window>& window) {
         size_t position = 0;
         std::string url;
         {
-            const std::lock_guard guard(window->mutex);
+            const Lock guard(window->mutex);
             if (!window->mayStart()) return;
             position = window->next++;
             window->places.try_emplace(position);
@@ -86,14 +88,14 @@ std::optional<HttpResponse> ReadAhead::take(const Url& url) {
     if (!window) return std::nullopt;
     std::optional<HttpResponse> answer;
     {
-        std::unique_lock lock(window->mutex);
+        Lock lock(window->mutex);
         const auto expected = window->positions.find(url.absoluteString());
         if (expected == window->positions.end()) return std::nullopt;
         const size_t position = expected->second;
         window->positions.erase(expected);
         for (; window->first < position; ++window->first) window->drop(window->first);
         if (position >= window->next) window->next = position + 1; // its turn has come before that of the window
-        const auto arrived = [&] {
+        const auto arrived = [&]() REQUIRES(window->mutex) {
             const auto place = window->places.find(position);
             return place == window->places.end() || place->second.arrived;
         };
@@ -110,7 +112,7 @@ std::optional<HttpResponse> ReadAhead::take(const Url& url) {
 void ReadAhead::forget(const Url& url) {
     const std::shared_ptr<Window> window = current();
     if (!window) return;
-    const std::lock_guard guard(window->mutex);
+    const Lock guard(window->mutex);
     window->positions.erase(url.absoluteString()); // its place goes when a later one is taken
 }
 

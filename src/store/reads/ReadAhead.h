@@ -1,11 +1,11 @@
 #pragma once
 
+#include "foundation/Mutex.h"
 #include "store/http/HttpTransport.h"
 
 #include <deque>
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <unordered_map>
@@ -44,8 +44,8 @@ private:
     std::shared_ptr<Window> current();
 
     const Start _start;
-    std::mutex _mutex; // guards _window
-    std::shared_ptr<Window> _window;
+    Mutex _mutex;
+    std::shared_ptr<Window> _window GUARDED_BY(_mutex);
 };
 
 } // namespace rolvane

@@ -3,6 +3,7 @@
 #include "foundation/Base64.h"
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "foundation/Mutex.h"
 #include "foundation/Paths.h"
 
 #include <cstring>
@@ -159,7 +160,7 @@ void VersionMemory::judge(const Owner& owner) {
 }
 
 void VersionMemory::belongTo(const Owner& owner) {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     if (_isRead)
         judge(owner);
     else
@@ -167,14 +168,14 @@ void VersionMemory::belongTo(const Owner& owner) {
 }
 
 void VersionMemory::revert() {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     _isRead = false;
     _judge.reset();
     ++_changes;
 }
 
 void VersionMemory::save(const Owner& owner) {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     if (!_isRead) {
         _judge = owner;
         return;
@@ -276,7 +277,7 @@ void VersionMemory::erase(std::string_view url) {
 }
 
 void VersionMemory::read(std::string_view url, const FileVersion& v) {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     need();
     if (!v.etag.empty())
         put(url, {Kind::tag, tagHash(v.etag)});
@@ -289,7 +290,7 @@ void VersionMemory::read(std::string_view url, const FileVersion& v) {
 void VersionMemory::wrote(std::string_view url, const EntityTag& etag, std::optional<Date> serverDate,
                           std::string_view content) {
     const std::string digest = etag.empty() && serverDate ? digestOf(content) : std::string();
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     need();
     if (!etag.empty())
         put(url, {Kind::tag, tagHash(etag)});
@@ -300,13 +301,13 @@ void VersionMemory::wrote(std::string_view url, const EntityTag& etag, std::opti
 }
 
 void VersionMemory::forget(std::string_view url) {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     need();
     erase(url);
 }
 
 bool VersionMemory::knows(std::string_view url, const FileVersion& v) {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     need();
     const uint64_t key = hash(url);
     const auto found = _entries.find(key);
@@ -331,25 +332,25 @@ bool VersionMemory::knows(std::string_view url, const FileVersion& v) {
 }
 
 bool VersionMemory::remembers(std::string_view url) {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     need();
     return _entries.contains(hash(url));
 }
 
 uint64_t VersionMemory::markOf(std::string_view url) {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     need();
     const auto found = _entries.find(hash(url));
     return found != _entries.end() && found->second.kind == Kind::tag ? found->second.value : 0;
 }
 
 uint64_t VersionMemory::changes() {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     return _changes;
 }
 
 size_t VersionMemory::count() {
-    std::lock_guard guard(_mutex);
+    Lock guard(_mutex);
     need();
     return _entries.size();
 }

@@ -1,10 +1,10 @@
 #pragma once
 
 #include "foundation/Date.h"
+#include "foundation/Mutex.h"
 #include "foundation/StrongString.h"
 
 #include <cstdint>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -68,32 +68,32 @@ private:
         uint64_t digest = 0; // of a written version: hash of the tag that would be its digest
         bool operator==(const Entry&) const = default;
     };
-    // With the lock held, as all of the following.
-    void need(); // the file is read
-    void load();
-    void takeRows(const std::string& text);
-    void takeFormerRows(const std::string& text);
-    void judge(const Owner& owner);
-    void put(std::string_view url, Entry entry);
-    void erase(std::string_view url);
-    uint64_t hash(std::string_view text) const;
-    uint64_t tagHash(const EntityTag& tag) const;
-    std::string rows(bool all) const;
-    bool append(const std::string& rows);
-    void replace(const std::string& rows);
+    void need() REQUIRES(_mutex); // the file is read
+    void load() REQUIRES(_mutex);
+    void takeRows(const std::string& text) REQUIRES(_mutex);
+    void takeFormerRows(const std::string& text) REQUIRES(_mutex);
+    void judge(const Owner& owner) REQUIRES(_mutex);
+    void put(std::string_view url, Entry entry) REQUIRES(_mutex);
+    void erase(std::string_view url) REQUIRES(_mutex);
+    uint64_t hash(std::string_view text) const REQUIRES(_mutex);
+    uint64_t tagHash(const EntityTag& tag) const REQUIRES(_mutex);
+    std::string rows(bool all) const REQUIRES(_mutex);
+    bool append(const std::string& rows) REQUIRES(_mutex);
+    void replace(const std::string& rows) REQUIRES(_mutex);
 
     const std::string _path;
     const size_t _capacity;
-    mutable std::mutex _mutex; // guards the following
-    bool _isRead = false;
-    bool _isForeign = false; // the file is of another database, or of a later state of this one
-    uint64_t _seed = 0;
-    Owner _owner;                // as saved last
-    std::optional<Owner> _judge; // whose it has to be, before it is read
-    std::unordered_map<uint64_t, Entry> _entries;
-    std::unordered_set<uint64_t> _unsaved; // hashes of URLs
-    uint64_t _changes = 0;
-    uint64_t _fileNumber = 0, _fileSize = 0; // of the file as it was read or written last; 0: of none
+    mutable Mutex _mutex;
+    bool _isRead GUARDED_BY(_mutex) = false;
+    bool _isForeign GUARDED_BY(_mutex) = false; // the file is of another database, or of a later state of this one
+    uint64_t _seed GUARDED_BY(_mutex) = 0;
+    Owner _owner GUARDED_BY(_mutex);                // as saved last
+    std::optional<Owner> _judge GUARDED_BY(_mutex); // whose it has to be, before it is read
+    std::unordered_map<uint64_t, Entry> _entries GUARDED_BY(_mutex);
+    std::unordered_set<uint64_t> _unsaved GUARDED_BY(_mutex); // hashes of URLs
+    uint64_t _changes GUARDED_BY(_mutex) = 0;
+    uint64_t _fileNumber GUARDED_BY(_mutex) = 0, _fileSize GUARDED_BY(_mutex) =
+                                                     0; // of the file as it was read or written last; 0: of none
 };
 
 } // namespace rolvane
