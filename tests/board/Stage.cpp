@@ -196,6 +196,7 @@ void Stage::keep(const std::string& name) {
 }
 
 void Stage::bringBack(const std::string& name) {
+    expireLocks(); // of the case before
     const std::string kept = _directory / ("kept/" + name), tree = _store.userDirectory(userOf('o')),
                       lists = _store.stateDirectory() + "/lists";
     shell("rm -rf " + home('o') + " " + home('w') + " " + home('r') + " " + tree + "/Contacts " + lists +

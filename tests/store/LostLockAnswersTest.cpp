@@ -241,6 +241,41 @@ TEST_F(LostLockAnswers, ALockThatCouldNotBeReleasedIsReleasedBeforeTheNextPass) 
     expectNothingLocked();
 }
 
+// Something in between says so, or the store is wrong for a moment: only a look tells whether the lock is gone.
+TEST_F(LostLockAnswers, ARefusedReleaseThatReleasedNothingIsMadeAgainBeforeTheNextPass) {
+    for (const int status : {400, 403, 404, 409, 410, 412, 423, 507}) {
+        SCOPED_TRACE(status);
+        auto mine = lock(alice);
+        ASSERT_TRUE(mine->tryLock());
+        alice.wire->intercept([&](const HttpRequest& request) {
+            return request.method == "UNLOCK" ? std::optional(answerOf(status)) : std::nullopt;
+        });
+        mine->unlock();
+        restore();
+        EXPECT_EQ(second.write("dateFile", "who"), 423);
+        releaseLocksOfEndedRuns(alice.manager);
+        expectNothingLocked();
+    }
+}
+
+TEST_F(LostLockAnswers, ALockWhoseRenewalWasRefusedAndThatStandsAllTheSameIsTakenAgain) {
+    for (const int status : {404, 409, 410, 412}) {
+        SCOPED_TRACE(status);
+        auto mine = lock(alice);
+        ASSERT_TRUE(mine->tryLock());
+        alice.wire->intercept([&](const HttpRequest& request) {
+            return request.method == "LOCK" ? std::optional(answerOf(status)) : std::nullopt;
+        });
+        EXPECT_FALSE(mine->renew());
+        EXPECT_FALSE(lock(alice)->tryLock()) << "by the same answer to whoever comes next";
+        restore();
+        auto next = lock(alice);
+        EXPECT_TRUE(next->tryLock());
+        next->unlock();
+        expectNothingLocked();
+    }
+}
+
 TEST_F(LostLockAnswers, ALockIsRenewedThoughTheAnswerToThatIsLostOnce) {
     auto mine = lock(alice);
     ASSERT_TRUE(mine->tryLock());

@@ -30,8 +30,8 @@ LockToken tokenInHeader(const HttpResponse& answer) {
     return LockToken(text->substr(1, text->size() - 2));
 }
 
-// True when the store has said that it knows the lock no more. A server in trouble, a refusal or somebody else's answer
-// says nothing of it.
+// True when the store says that it knows no such thing. A server in trouble, a refusal or somebody else's answer says
+// nothing of it.
 bool isGone(const HttpResponse& answer) {
     const int status = answer.complete() ? answer.status : 0;
     return status == 404 || status == 409 || status == 410 || status == 412;
@@ -87,14 +87,20 @@ bool isNotThere(StoreSession& session, const Url& endpoint, const LockToken& tok
                                              [&](const LockGrant& lock) { return lock.token == token; });
 }
 
-// Whether the store knows the lock no more. Asked twice where no answer comes: a lock that stays is in everybody's way.
-// A store may refuse to release what is gone with any error (httpd: 400), so a refusal is followed by a look.
+// The answer to a renewal says so, and a look as well: something in between may have answered, and a lock that stays is
+// in everybody's way.
+bool isGoneThere(StoreSession& session, const Url& endpoint, const LockToken& token, const HttpResponse& answer) {
+    return isGone(answer) && isNotThere(session, endpoint, token);
+}
+
+// Whether the store knows the lock no more. Asked twice where no answer comes. A store may refuse to release what is
+// gone with any error (httpd: 400), so a refusal is followed by a look.
 bool release(StoreSession& session, const Url& endpoint, const LockToken& token) {
     HttpRequest r = StoreSession::request("UNLOCK", endpoint);
     r.headers = {{"Lock-Token", "<" + token.str() + ">"}};
     HttpResponse answer = session.sendUnnoted(r);
     if (!answer.complete()) answer = session.sendUnnoted(std::move(r));
-    if (answer.ok() || isGone(answer)) return true;
+    if (answer.ok()) return true;
     if (answer.complete() && isNotThere(session, endpoint, token)) return true;
     session.noteFailure("UNLOCK", endpoint, answer);
     return false;
@@ -193,7 +199,7 @@ bool StoreLock::takeOver(CXDAVManager::Impl& client, const std::optional<LockTok
     if (isPlausible(abandoned)) {
         const HttpResponse answer = ask(abandoned);
         if (take(answer, abandoned)) return true;
-        if (isGone(answer)) client.tokens.forgetAbandoned(where);
+        if (isGoneThere(client.session, *_endpoint, abandoned, answer)) client.tokens.forgetAbandoned(where);
     }
     const auto takeOverThe = [this](const LockToken& token, const char* whose) {
         if (!isPlausible(token) || !take(ask(token), token)) return false;
@@ -298,8 +304,9 @@ bool StoreLock::renew() {
     HttpResponse answer = ask(token);
     if (!answer.complete()) answer = ask(token);
     if (take(answer, token)) return true;
-    if (const auto client = _client.lock()) client->session.noteFailure("LOCK", *_endpoint, answer);
-    lose(isGone(answer));
+    const auto client = _client.lock();
+    if (client) client->session.noteFailure("LOCK", *_endpoint, answer);
+    lose(client && isGoneThere(client->session, *_endpoint, token, answer));
     return false;
 }
 
