@@ -143,7 +143,8 @@ CLI::App* addCommand(CLI::App& parent, Context& context, const std::string& name
     translateOptions(*command);
     if (body)
         command->final_callback([&context, path = pathOf(*command), body = std::move(body)] {
-            Preferences::shared().keepElsewhere(daemonMemory()); // makes its directory, which --help does not need
+            // Makes the memory's directory, which --help does not need, nor an administrator's home for a store.
+            if (!path.starts_with("store ")) Preferences::shared().keepElsewhere(daemonMemory());
             context.command = path;
             body();
         });

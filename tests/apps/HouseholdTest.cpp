@@ -156,6 +156,14 @@ TEST_F(Household, KeepsItsSettingsWhereNewOnesCannotBeUsed) {
     EXPECT_EQ(reload().status, kDone);
 }
 
+TEST_F(Household, LeavesNothingInTheHomeOfWhoeverAdministersIt) {
+    settings("certificate = own\n");
+    ASSERT_EQ(start().status, kDone);
+    done("keeper", "mkdir home && HOME=$PWD/home rolvane store user list " + place() +
+                       " && HOME=$PWD/home rolvane store user quota " + place());
+    EXPECT_EQ(done("keeper", "ls -A home"), "");
+}
+
 TEST_F(Household, TellsAPersonWithoutRoomAndLosesNothing) {
     settings("certificate = own\nquota = 1M\n");
     ASSERT_EQ(start().status, kDone);
