@@ -149,12 +149,17 @@ bool CXDVaultraConduit::updateRecord(CXDChangeRecord& record, int& code) {
     if (!base || !record.person()) return false;
     const UserName user = record.user().value_or(UserName());
     const UniqueId shared = cxNormalizedUID(*record.person()), everybody{std::string(layout::kAllGroup)};
-    const ContactWrites::Place place{
-        user, layout::contactLocation(*base, *record.person()), inDatabase(record), mergesInto(user), *base, [&] {
-            const Dictionary list = engine().knownGroupState(kConduitVaultra, user, everybody);
-            return list[kMemberUIDState].array().containsString(shared.str());
-        },
-        _newOnStore.isNamedAlone(inDatabase(record))};
+    const ContactWrites::Place place{user,
+                                     layout::contactLocation(*base, *record.person()),
+                                     inDatabase(record),
+                                     mergesInto(user),
+                                     *base,
+                                     [&] {
+                                         const Dictionary list =
+                                             engine().knownGroupState(kConduitVaultra, user, everybody);
+                                         return list[kMemberUIDState].array().containsString(shared.str());
+                                     },
+                                     _newOnStore.isNamedAlone(inDatabase(record))};
     if (_inDoubt.contains(place.uniqueId) || !_writes.write(place, contentOf(record), code)) return false;
     if (place.wasNeverThere || _newRecords.contains(place.uniqueId))
         _newOnStore.wasPut(user, place.uniqueId, _world.clock.now());

@@ -29,8 +29,8 @@ std::vector<CXReached> ReachedStore::all() {
     auto s = _database.statement("SELECT r.uid, t.tree, t.since, " + hasFile +
                                  " FROM reached t JOIN records r ON r.id=t.record_id");
     while (s.step())
-        all.push_back({UniqueId(s.textView(0)), UserName(std::string(s.textView(1))), Date(s.real(2)),
-                       s.integer(3) != 0});
+        all.push_back(
+            {UniqueId(s.textView(0)), UserName(std::string(s.textView(1))), Date(s.real(2)), s.integer(3) != 0});
     return all;
 }
 

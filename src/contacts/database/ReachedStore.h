@@ -12,9 +12,9 @@ namespace rolvane {
 // A new contact or group that a store has had, put there by a pass that may not have come to its end; or a name in
 // lists of a store that has not taken the record's file yet.
 struct CXReached {
-    UniqueId uniqueId; // as the database names the record
-    UserName tree;     // whose it is, as change records name them
-    Date since;        // by this machine's clock
+    UniqueId uniqueId;   // as the database names the record
+    UserName tree;       // whose it is, as change records name them
+    Date since;          // by this machine's clock
     bool hasFile = true; // false: lists name it, and no file of it is known to have come
 };
 
@@ -32,7 +32,7 @@ public:
     // Of records that are stored. A later file takes the place of whatever is noted; a name without a file is only
     // noted where nothing is.
     void note(const CXReached& reached);
-    void forget(const UniqueId& uid);    // nothing happens where none is noted
+    void forget(const UniqueId& uid); // nothing happens where none is noted
 
 private:
     bool hasTable();
