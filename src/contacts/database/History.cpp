@@ -128,7 +128,7 @@ private:
         return _rolvane.impl().changeLog.isTouchedAfter(detail);
     }
 
-    // Whatever was changed since was taken back since.
+    // Each change since then has been taken back, too.
     bool isAsAdded(const CXChangeDetail& detail) {
         std::lock_guard lock(_rolvane.impl().mutex);
         const auto next = _rolvane.impl().changeLog.next(detail);

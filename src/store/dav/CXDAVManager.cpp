@@ -52,7 +52,7 @@ std::string beside(const std::string& versions, const char* name) {
     return versions.empty() ? std::string() : versions.substr(0, versions.rfind('/') + 1) + name;
 }
 
-// Who asks whom, and for what: anybody else is shown something else.
+// The user, the store and the kind of the question: another asker may be shown something else.
 std::string ownerOf(const CXDAVAccount& account, const char* what) {
     return std::string(what) + "\n" + account.user.str() + "\n" + account.endpoint + "\n" + account.nameHost;
 }
