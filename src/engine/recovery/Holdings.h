@@ -7,6 +7,7 @@
 #include "engine/queue/ChangeQueue.h"
 
 #include <unordered_map>
+#include <unordered_set>
 
 namespace rolvane {
 
@@ -18,12 +19,18 @@ inline bool isPublished(const CXGroup& group) {
 
 // What the database still holds, under the own table or that of the subscribed copies; each identifier is asked for
 // once. What it does not hold is withdrawn from the store, so a damaged database throws CXDamagedDatabase.
+//
+// A group of a store whose creation waits in the queue has never been here, and is not gone. (One that was gathered
+// just now may be the own write of a killed pass.)
 class Holdings {
 public:
-    explicit Holdings(CXRolvane& rolvane) : _rolvane(rolvane), _absences(rolvane) {}
+    // `records`: `fresh` new ones and then the queue.
+    Holdings(CXRolvane& rolvane, const CXDChangeRecords& records, size_t fresh);
     bool person(const UniqueId& uid) { return holds(uid, kCXPersonTable, kCXSubscribedPersonTable); }
     bool group(const UniqueId& uid) {
-        return uid.str() == kCXAllGroupUID || uid == kPeopleGroup || holds(uid, kCXGroupTable, kCXSubscribedGroupTable);
+        return uid.str() == kCXAllGroupUID || uid == kPeopleGroup ||
+               _toCome.contains(cxUIDWithTableName(uid, kCXGroupTable)) ||
+               holds(uid, kCXGroupTable, kCXSubscribedGroupTable);
     }
 
 private:
@@ -39,6 +46,7 @@ private:
     CXRolvane& _rolvane;
     AbsenceCheck _absences;
     std::unordered_map<UniqueId, bool> _known;
+    std::unordered_set<UniqueId> _toCome;
 };
 
 } // namespace rolvane

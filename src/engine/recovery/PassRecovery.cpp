@@ -37,7 +37,7 @@ void PassRecovery::begin(CXDChangeRecords& records, size_t fresh) {
     _underWay = underWayInAnyForm(_parts.state.underWay());
     _unsettled = unsettledOfOthers(records, fresh);
     restatement().restate(records, fresh);
-    settle(records);
+    settle(records, fresh);
 }
 
 void PassRecovery::restateForTheFolder(CXDChangeRecords& waiting) const {
@@ -46,10 +46,10 @@ void PassRecovery::restateForTheFolder(CXDChangeRecords& waiting) const {
     restatement.dropRemovalsOfWhatIsBack(waiting, 0);
 }
 
-void PassRecovery::settle(CXDChangeRecords& records) {
+void PassRecovery::settle(CXDChangeRecords& records, size_t fresh) {
     for (const SharedTree& tree : treesOf(*_underWay))
         _parts.state.withConduitData([&](Dictionary& data) {
-            const Dictionary left = settleUnderWay(*_underWay, tree, records, data, _parts.with.rolvane);
+            const Dictionary left = settleUnderWay(*_underWay, tree, records, fresh, data, _parts.with.rolvane);
             _end.unread = underWayTogether(_end.unread, left);
         });
 }

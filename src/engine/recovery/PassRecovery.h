@@ -39,7 +39,7 @@ public:
     void storeNote(); // of writes that stay under way; without synchronising
 
 private:
-    void settle(CXDChangeRecords& records);
+    void settle(CXDChangeRecords& records, size_t fresh);
     void storeNoteNow(bool gatheringChanged);
     std::vector<SharedTree> treesOf(const Dictionary& underWay) const;
     std::function<bool(const UserName&)> hasCopies() const;

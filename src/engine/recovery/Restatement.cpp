@@ -122,7 +122,7 @@ CXDChangeRecordPtr whatIsTrueStill(const CXDChangeRecordPtr& record, const CXGro
 
 void Restatement::withdrawWhatIsGone(CXDChangeRecords& records, size_t fresh) const {
     if (isLeftOut("what is gone")) return;
-    Holdings holdings(rolvane);
+    Holdings holdings(rolvane, records, fresh);
     CXDChangeRecords removals;
     for (size_t i = fresh; i < records.size(); ++i) {
         const CXDChangeRecord& record = *records[i];

@@ -70,9 +70,10 @@ bool isWrite(const CXDChangeRecord& record) {
 // Makes the records of one pass's beginning, for one tree.
 class Settlement {
 public:
-    Settlement(const CXDChangeRecords& records, const SharedTree& tree, Dictionary& conduitData, CXRolvane& rolvane)
+    Settlement(const CXDChangeRecords& records, size_t fresh, const SharedTree& tree, Dictionary& conduitData,
+               CXRolvane& rolvane)
         : _tree(tree), _conduitData(conduitData), _known(knownGroups(conduitData, tree.user)), _rolvane(rolvane),
-          _holdings(rolvane) {
+          _holdings(rolvane, records, fresh) {
         for (const CXDChangeRecordPtr& record : records) {
             if (record->user() != _tree.user) continue;
             if (record->group() && isWrite(*record)) _gathered.insert(shared(*record->group(), kCXGroupTable));
@@ -328,9 +329,9 @@ Dictionary adrift(const Dictionary& underWay, const Dictionary& conduitData, con
     return left.empty() ? end.unread : underWayTogether(end.unread, Dictionary{{kSelf.str(), left}});
 }
 
-Dictionary settleUnderWay(const Dictionary& underWay, const SharedTree& tree, CXDChangeRecords& records,
+Dictionary settleUnderWay(const Dictionary& underWay, const SharedTree& tree, CXDChangeRecords& records, size_t fresh,
                           Dictionary& conduitData, CXRolvane& rolvane) {
-    Settlement settlement(records, tree, conduitData, rolvane);
+    Settlement settlement(records, fresh, tree, conduitData, rolvane);
     const Dictionary of = underWay[tree.user.str()].dictionary();
     Dictionary left;
     for (const Value& person : of[kPeople].array()) settlement.person(UniqueId(person.string()));

@@ -33,10 +33,10 @@ struct SharedTree {
 };
 // What was under way in one tree when a pass was killed is made what the database says: whoever or whatever is gone is
 // removed from the store, members are put in or taken out, names are set that the pass may have written. The records
-// for it are added to `records`, which is what the pass has gathered and the queue; and those are taken out by which
-// the store would bring the same back. Of groups only those are spoken of that are shared still, which is to say that
-// they are known or gathered. Gives what of it cannot be settled before the tree is read.
-Dictionary settleUnderWay(const Dictionary& underWay, const SharedTree& tree, CXDChangeRecords& records,
+// for it are added to `records`, which is what the pass has gathered, `fresh` of them, and the queue; and those are
+// taken out by which the store would bring the same back. Of groups only those are spoken of that are shared still,
+// which is to say that they are known or gathered. Gives what of it cannot be settled before the tree is read.
+Dictionary settleUnderWay(const Dictionary& underWay, const SharedTree& tree, CXDChangeRecords& records, size_t fresh,
                           Dictionary& conduitData, CXRolvane& rolvane);
 
 // What is known at the end of a pass, identifiers in their shared form.
