@@ -292,9 +292,9 @@ TEST(SubscribingWithoutABus, WorksAllTheSame) {
 
 TEST(SubscribingWithoutAnAccount, SaysHowToMakeOne) {
     CommandWorld world;
-    EXPECT_TRUE(saysOnce(world.rolvane({"subscribe", "alice"}), kNoSuchThing, "rolvane account set"));
-    EXPECT_TRUE(saysOnce(world.rolvane({"share", "alice"}), kNoSuchThing, "rolvane account set"));
-    EXPECT_TRUE(saysOnce(world.rolvane({"rights", "alice"}), kNoSuchThing, "rolvane account set"));
+    EXPECT_TRUE(saysOnce(world.rolvane({"subscribe", "alice"}), kNoSuchThing, "rolvane setup"));
+    EXPECT_TRUE(saysOnce(world.rolvane({"share", "alice"}), kNoSuchThing, "rolvane setup"));
+    EXPECT_TRUE(saysOnce(world.rolvane({"rights", "alice"}), kNoSuchThing, "rolvane setup"));
 }
 
 } // namespace
