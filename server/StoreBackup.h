@@ -19,8 +19,8 @@ public:
     // The same in a directory, by the name rolvane-store-DATE.tar.gz; of the files with such names the `keep` youngest
     // stay, all with 0. Returns the path.
     std::string writeInto(const std::string& directory, int keep) const;
-    // Puts the archive ("-": standard input) in the place of what is there. The store must not run. Returns the
-    // directory that holds what was there before.
+    // Replaces the store by the archive ("-": standard input). The store must not run. Returns the directory that holds
+    // the former one.
     std::string restore(const std::string& file) const;
 
 private:

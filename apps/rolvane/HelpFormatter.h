@@ -13,7 +13,7 @@ public:
 
     std::string make_subcommand(const CLI::App* command) const override;
     std::string make_option(const CLI::Option* option, bool isPositional) const override;
-    // A group of options of which one may be given: its description, and the options.
+    // A group of options that exclude one another: its description, and the options.
     std::string make_expanded(const CLI::App* group) const override;
     std::string make_description(const CLI::App* command) const override;
     std::string make_usage(const CLI::App* command, std::string name) const override;

@@ -3,10 +3,10 @@
 #include <condition_variable>
 #include <mutex>
 
-// Declarations of which mutex guards what. Clang checks them where sources are looked through (packaging/lint/run): a
-// member that is GUARDED_BY a mutex is only read and written while that is held, and a function that
-// REQUIRES one is only called so. Other compilers ignore them. The analysis follows no pointers: where an
-// object hands its mutex out, or a lock travels, NO_THREAD_SAFETY_ANALYSIS stands with the reason.
+// Declarations of mutexes and the members that they guard. Lint lets clang check them (packaging/lint/run): a member
+// that is GUARDED_BY a mutex is only read and written while that is held, and a function that REQUIRES one is only
+// called so. Other compilers ignore them. The analysis follows no pointers: where an object hands its mutex out, or a
+// lock travels, NO_THREAD_SAFETY_ANALYSIS stands with the reason.
 #if defined(__clang__)
 #define ROLVANE_THREAD_SAFETY(attribute) __attribute__((attribute))
 #else

@@ -29,8 +29,8 @@ public:
     std::vector<CXReached> all(); // in no order
 
     // Within a transaction ---------------------------------------------------------------------------------------
-    // Of records that are stored. A later file takes the place of whatever is noted; a name without a file is only
-    // noted where nothing is.
+    // The record has to be stored. A later file replaces any note; a name without a file is only noted where there is
+    // no note yet.
     void note(const CXReached& reached);
     void forget(const UniqueId& uid); // nothing happens where none is noted
 

@@ -28,8 +28,8 @@ struct Restatement {
 
     // `records`: the pass's input, `fresh` new ones and then the queue, which alone is looked at, and of it the changes
     // in trees whose copies are here. Changes of groups that give way may be on the store, their answers lost: the note
-    // of what was under way still has them. Main thread. Throws CXDamagedDatabase, and `records` may then be restated
-    // in part.
+    // of writes under way still has them. Main thread. Throws CXDamagedDatabase; some of `records` may then be restated
+    // already.
     void restate(CXDChangeRecords& records, size_t fresh) const;
     // The same but for the comparison of groups.
     void withdrawWhatIsGone(CXDChangeRecords& records, size_t fresh) const;

@@ -7,7 +7,7 @@
 
 namespace rolvane {
 
-// The form of what is cached: numbers as the machine has them, texts behind their sizes.
+// The form of a cache file: numbers as the machine has them, texts behind their sizes.
 
 inline void cacheAppend(std::string& out, uint64_t number) {
     out.append(reinterpret_cast<const char*>(&number), sizeof number);
