@@ -139,7 +139,7 @@ void World::tell(const std::string& text) {
 // Processes ----------------------------------------------------------------------------------------------------------
 
 void World::inProcess(const std::string& what, char who, const Work& work, View* view) {
-    tell("== " + what + " of " + who);
+    tell("== " + what + " of " + who + ", process " + std::to_string(++_processes));
     int ends[2];
     if (::pipe2(ends, O_CLOEXEC) != 0) throw CXException("CXWorldException", "no pipe");
     const pid_t child = ::fork();
@@ -178,6 +178,19 @@ void World::inProcess(const std::string& what, char who, const Work& work, View*
     ::waitpid(child, &status, 0);
     if (WIFSIGNALED(status) && WTERMSIG(status) != SIGKILL)
         _wrong.push_back(what + " of " + who + " ended by signal " + std::to_string(WTERMSIG(status)));
+    copyAll("end");
+}
+
+void World::copyAll(const std::string& moment) {
+    if (!_options.copies) return;
+    const std::string where = _directory + "/copies/" + std::to_string(_processes) + "-" + moment;
+    fs::create_directories(where);
+    std::error_code none;
+    for (const Person& each : _people)
+        for (const char* suffix : {"", "-wal"})
+            fs::copy_file(each.database() + suffix, where + "/" + each.role + ".db" + suffix, none);
+    fs::copy(_store.userDirectory(_people[0].account.user.str()) + "/Contacts", where + "/tree",
+             fs::copy_options::recursive, none);
 }
 
 void World::take(char who, const std::string& line, View* view) {
@@ -282,10 +295,12 @@ void World::live(char role, const std::string& stamp, const Weather& weather, ui
                 edit(role, stamp + "b" + std::to_string(++beside), number, report);
         };
     daemon.pass();
+    copyAll("first");
     if (daemon.nothingWaits()) report.line(lines::kSettled);
     for (size_t more = chance.below(3); more > 0; --more) {
         if (edits && chance.happens(0.7)) edit(role, stamp + "d" + std::to_string(more), chance.next(), report);
         chance.happens(0.6) ? daemon.deliver() : daemon.pass();
+        copyAll("more" + std::to_string(more));
         if (daemon.nothingWaits()) report.line(lines::kSettled);
     }
 }

@@ -17,6 +17,7 @@ struct Options {
     int steps = 0;    // 0: as the seed says
     std::string keep; // directory for the files and the story of worlds that end with a difference
     bool keepAll = false;
+    bool copies = false; // everybody's database and the tree as each pass leaves them, among what is kept
 };
 
 // What a world really had, and how it ended.
@@ -62,6 +63,7 @@ private:
     View viewOf(char role);
     std::vector<std::string> compareAll();
     void tell(const std::string& text);
+    void copyAll(const std::string& moment);
 
     PrivateStore& _store;
     const uint64_t _seed;
@@ -75,6 +77,7 @@ private:
     std::vector<std::string> _wrong, _wrote; // what processes told
     bool _settling = false;                  // all is well again
     int _log = -1;
+    size_t _processes = 0;
 };
 
 } // namespace rolvane::worlds

@@ -21,7 +21,7 @@ namespace rolvane::worlds {
 namespace {
 
 constexpr const char* kUsage = R"(usage: worlds [--seeds LIST] [--jobs N] [--without WHAT,...] [--steps N]
-              [--keep DIRECTORY] [--keep-all]
+              [--keep DIRECTORY] [--keep-all] [--copies]
 
 Each seed is a world: an owner, a writer and a reader, who edit while requests fail, daemons are killed, the store is
 away and disks are full. In the end everybody's copy, the store and a plain model must be equal. A line a world, then a
@@ -34,6 +34,7 @@ table; exit status 1 when anything differs.
              time-out, portal, "lost answer", "cut answer", and locks: those at LOCK and UNLOCK, and merging: where both have edited one contact either version may stand
   --steps    how many steps a world has, instead of as its seed says
   --keep     where the files and the story of each world that differs are put; with --keep-all, of every one
+  --copies   everybody's database and the tree as each pass leaves them are kept there, too
 )";
 
 struct Totals {
@@ -83,6 +84,10 @@ Arguments argumentsOf(int argc, char** argv) {
         }
         if (name == "--keep-all") {
             a.options.keepAll = true;
+            continue;
+        }
+        if (name == "--copies") {
+            a.options.copies = true;
             continue;
         }
         if (i + 1 == argc) misuse(name + " needs a value");
