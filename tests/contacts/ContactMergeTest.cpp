@@ -316,6 +316,19 @@ TEST(ContactMerge, AnEntryThatCameTellsThatAllOfItsVersionCame) {
     EXPECT_EQ(content(result.contact), content(theirs.contact()));
 }
 
+TEST(ContactMerge, AnEntryThatCameAndWasChangedThereDoesNotStandBesideItself) {
+    Facts base, sent, theirs;
+    base.phone = {{"a", {"home", "1"}}};
+    sent.phone = {{"a", {"home", "1"}}, {"b", {"home", "2"}}};
+    theirs.phone = {{"a", {"home", "1"}}, {"b", {"work", "22"}}};
+    const Dictionary common = cxBaseAfterSending(base.contact(), sent.contact(), theirs.contact());
+    for (const CXSide later : {CXSide::ours, CXSide::theirs}) {
+        const auto result = mergedContact(common, sent.contact(), theirs.contact(), later);
+        EXPECT_EQ(content(result.contact), content(theirs.contact()));
+        EXPECT_TRUE(result.conflicts.empty());
+    }
+}
+
 TEST(ContactMerge, OfASingleValueThatMayHaveComeTheOthersStandsAndItIsAConflict) {
     const Dictionary base{{kCXFirstNameProperty, "0"}}, sent{{kCXFirstNameProperty, "1"}},
         theirs{{kCXFirstNameProperty, "2"}};

@@ -179,8 +179,12 @@ Value sentMultiValue(const Value& base, const Value& sent, const Value& theirs) 
         if (t == kNone && oursOf[b] == kNone) continue; // both have removed it
         add(t != kNone && cameAsSent(t) ? there[t] : before[b]);
     }
-    for (size_t t = 0; t < there.size(); ++t)
-        if (!isOfBase[t] && cameAsSent(t)) add(there[t]);
+    for (size_t t = 0; t < there.size(); ++t) {
+        if (isOfBase[t] || sentOfTheirs[t] == kNone) continue;
+        // With the identifier that it was given here it has come, whatever it says by now.
+        const auto& entry = cameAsSent(t) ? there[t] : ours[sentOfTheirs[t]];
+        if (!result.indexForIdentifier(entry.identifier)) add(entry);
+    }
     return result.toValue();
 }
 
