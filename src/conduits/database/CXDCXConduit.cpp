@@ -11,6 +11,7 @@
 #include "contacts/records/Constants.h"
 #include "contacts/records/Identifier.h"
 #include "foundation/Preferences.h"
+#include "foundation/TestSwitch.h"
 #include "model/Computers.h"
 #include "model/PayloadKeys.h"
 #include "model/RemoteLocationMap.h"
@@ -114,10 +115,14 @@ CXDChangeRecords CXDCXConduit::changeRecords() {
 
     ChangeCapture capture = newCapture();
     capture.reader().expectMany();
+    std::unordered_set<UniqueId> groups;
     for (const CXSearchElement& modified :
          {groupsModifiedAfter<CXGroup>(ownSince), groupsModifiedAfter<CXSubscribedGroup>(since)})
-        for (const CXRecordRef& group : rolvane().recordsMatchingSearchElement(modified))
+        for (const CXRecordRef& group : rolvane().recordsMatchingSearchElement(modified)) {
             capture.addGroup(std::dynamic_pointer_cast<CXGroup>(group));
+            groups.insert(group->uniqueId());
+        }
+    if (!isLeftOut("groups of the journal")) addGroupsOfTheJournal(capture, scan, std::move(groups));
     addUnsettledGroups(capture);
     addUnsettledPeople(capture);
     rolvane().forEachPersonModifiedSince(ownSince, kCXPersonTable, [&](const CXRow& person) {
@@ -185,6 +190,16 @@ bool CXDCXConduit::saysSomething(const CXSubscription& subscription) const {
         return true;
     const CXAllGroupRef group = rolvane().allGroupForRemoteLocation(location);
     return group && (group->memberCount() > 0 || !group->subgroupUniqueIds().empty());
+}
+
+// Groups that were saved while the last pass ran, dated before its end. The journal delivers them behind this pass, by
+// when a change from the store may have taken the place of theirs.
+void CXDCXConduit::addGroupsOfTheJournal(ChangeCapture& capture, const Scan& scan, std::unordered_set<UniqueId> added) {
+    for (const UniqueId& uid : rolvane().changedByOthers(rolvane().cursorPosition(), scan.journalPosition)) {
+        const std::string_view table = cxTableName(uid);
+        if ((table == kCXGroupTable || table == kCXSubscribedGroupTable) && added.insert(uid).second)
+            capture.addGroup(std::dynamic_pointer_cast<CXGroup>(rolvane().recordForUniqueId(uid)));
+    }
 }
 
 // Groups that a former pass may have left on the store in an older state, or left there although they are gone.

@@ -148,6 +148,7 @@ private:
     void changeOwnList(const CXDChangeRecord& record, const char* property);
     bool saysSomething(const CXSubscription& subscription) const;
     void addAllGroups(ChangeCapture& capture);
+    void addGroupsOfTheJournal(ChangeCapture& capture, const Scan& scan, std::unordered_set<UniqueId> added);
     void addUnsettledGroups(ChangeCapture& capture);
     void addUnsettledPeople(ChangeCapture& capture);
     const std::string& ownProgram() const;
