@@ -81,6 +81,11 @@ protected:
     CXRecordRef copyOf(const CXRecordRef& record, std::string_view table) {
         return bob.application->recordForUniqueId(cxUIDWithTableName(record->uniqueId(), table));
     }
+    CXGroupRef groupCopy() { return std::dynamic_pointer_cast<CXGroup>(copyOf(friends, kCXSubscribedGroupTable)); }
+    bool isMember(const CXPersonRef& person) {
+        const auto members = friends->memberUniqueIds();
+        return std::find(members.begin(), members.end(), person->uniqueId()) != members.end();
+    }
     void refuseFileOf(const UniqueId& record) {
         bob.wire->intercept([part = record.str().substr(0, 36)](const HttpRequest& request) {
             const bool isIt = request.method == "PUT" && request.url.encodedPath().find(part) != std::string::npos;
@@ -228,6 +233,94 @@ TEST_F(TakenBackPass, ANewGroupKeepsTheNameThatItIsGivenBehindIt) {
     rename(alice, crew, "Band");
     settle();
     EXPECT_EQ(crew->name(), "Band") << log.text();
+}
+
+// Nobody has taken back what the pass wrote, and to Alice's daemon the group is still one that the store has to get.
+TEST_F(TakenBackPass, ANewGroupKeepsTheNameThatSomebodyElseGivesBehindIt) {
+    const CXGroupRef crew = alice.group("Crew", {people[1]});
+    passThatIsTakenBack(alice, kAtTheEnd);
+    bob.pass();
+    const CXRecordRef copy = copyOf(crew, kCXSubscribedGroupTable);
+    ASSERT_TRUE(copy) << log.text();
+    rename(bob, copy, "Bob's");
+    bob.pass();
+    const auto nameThere = [&] { return contentOf(world->file(crew->uniqueId().str()))[kCXGroupNameProperty]; };
+    ASSERT_EQ(nameThere(), Value("Bob's")) << log.text();
+    passThatIsTakenBack(alice, kAtTheEnd);
+    EXPECT_EQ(nameThere(), Value("Bob's")) << log.text();
+    settle();
+    EXPECT_EQ(crew->name(), "Bob's") << log.text();
+}
+
+// The second of the two passes has seen on the store what the first had written.
+TEST_F(TakenBackPass, AMemberWhomItsOwnerTakesOutBehindTwoOfThemStaysOut) {
+    bob.pass();
+    groupCopy()->addMember(bob.copyOf(people[1]));
+    bob.application->save();
+    passThatIsTakenBack(bob, kAtTheEnd);
+    alice.pass();
+    ASSERT_TRUE(isMember(people[1])) << log.text();
+    passThatIsTakenBack(bob, kAtTheEnd);
+    friends->removeMember(people[1]);
+    alice.application->save();
+    alice.pass();
+    settle();
+    EXPECT_FALSE(isMember(people[1])) << log.text();
+}
+
+TEST_F(TakenBackPass, AMemberWhomItsOwnerPutsInAgainBehindTwoOfThemStaysIn) {
+    bob.pass();
+    groupCopy()->removeMember(bob.copyOf(people[2]));
+    bob.application->save();
+    passThatIsTakenBack(bob, kAtTheEnd);
+    alice.pass();
+    ASSERT_FALSE(isMember(people[2])) << log.text();
+    passThatIsTakenBack(bob, kAtTheEnd);
+    friends->addMember(people[2]);
+    alice.application->save();
+    alice.pass();
+    settle();
+    EXPECT_TRUE(isMember(people[2])) << log.text();
+}
+
+TEST_F(TakenBackPass, AGroupThatItsOwnerTakesOutBehindTwoOfThemStaysOut) {
+    const CXGroupRef crew = alice.group("Crew", {people[1]});
+    alice.pass();
+    bob.pass();
+    groupCopy()->addSubgroup(std::dynamic_pointer_cast<CXGroup>(copyOf(crew, kCXSubscribedGroupTable)));
+    bob.application->save();
+    passThatIsTakenBack(bob, kAtTheEnd);
+    alice.pass();
+    ASSERT_EQ(friends->subgroupUniqueIds().size(), 1u) << log.text();
+    passThatIsTakenBack(bob, kAtTheEnd);
+    friends->removeSubgroup(crew);
+    alice.application->save();
+    alice.pass();
+    settle();
+    EXPECT_TRUE(friends->subgroupUniqueIds().empty()) << log.text();
+}
+
+// By then the daemon's scan looks behind the end of the pass, and only the journal knows of the name.
+TEST_F(TakenBackPass, ANameThatIsGivenDuringAPassIsSentByTheNextDaemon) {
+    bob.pass();
+    const CXGroupRef copy = groupCopy();
+    rename(alice, friends, "Alice's");
+    rename(bob, copy, "Bob's");
+    alice.pass();
+    bob.pass();
+    bool named = false;
+    bob.wire->intercept([&](const HttpRequest& request) -> std::optional<HttpResponse> {
+        if (request.method == "PUT" && !std::exchange(named, true)) rename(bob, copy, "Third");
+        return std::nullopt;
+    });
+    bob.copyOf(people[0])->setValue(Value("A note"), kCXNoteProperty);
+    bob.application->save();
+    ASSERT_TRUE(bob.database->deliverExternalChanges());
+    bob.wire->intercept({});
+    ASSERT_TRUE(named) << log.text();
+    bob.start();
+    settle();
+    EXPECT_EQ(friends->name(), "Third") << log.text();
 }
 
 // Bob's version came, and Alice has seen it, though Bob's daemon does not know that.

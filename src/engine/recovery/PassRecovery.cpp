@@ -47,15 +47,19 @@ void PassRecovery::restateForTheFolder(CXDChangeRecords& waiting) const {
 }
 
 void PassRecovery::settle(CXDChangeRecords& records, size_t fresh) {
+    bool hasArrived = false;
     for (const SharedTree& tree : treesOf(*_underWay))
         _parts.state.withConduitData([&](Dictionary& data) {
-            const Dictionary left = settleUnderWay(*_underWay, tree, records, fresh, data, _parts.with.rolvane);
-            _end.unread = underWayTogether(_end.unread, left);
+            const auto settled = settleUnderWay(*_underWay, tree, records, fresh, data, _parts.with.rolvane);
+            _end.unread = underWayTogether(_end.unread, settled.left);
+            hasArrived |= settled.hasArrived;
+            if (!isLeftOut("names of others")) _namesOfOthers.addEntriesFrom(settled.namesOfOthers);
         });
+    if (hasArrived && !isLeftOut("arrivals")) storeNoteNow(true);
 }
 
 void PassRecovery::willWrite(const CXDChangeRecords& outOfOrder) {
-    const Dictionary now = withSubscriptions(underWay(outOfOrder));
+    const Dictionary now = withoutNames(withSubscriptions(underWay(outOfOrder)), _namesOfOthers);
     _underWay = underWayTogether(*_underWay, now);
     _end.removed = removedBy(outOfOrder);
     const bool gatheringChanged = _parts.with.rolvane.hasUnsavedChanges();

@@ -51,6 +51,7 @@ private:
 
     EngineParts& _parts;
     std::optional<Dictionary> _underWay; // none: the note of it was not read yet, and stays as it is
+    Dictionary _namesOfOthers;           // in the place of such as a killed pass wrote, by group
     Dictionary _unsettled;               // groups whose changes may have been lost
     PassEnd _end;
 };

@@ -49,6 +49,10 @@ const char* listOf(int32_t type) {
     }
 }
 
+std::string_view tableOf(const char* list) {
+    return list == kSubgroupAdds || list == kSubgroupRemoves ? kCXGroupTable : kCXPersonTable;
+}
+
 void noteGroup(Dictionary& group, const CXDChangeRecord& record) {
     const Value content = record.inMemoryPayload();
     const Dictionary payload = content.isDictionary() ? content.dictionary() : Dictionary();
@@ -58,8 +62,7 @@ void noteGroup(Dictionary& group, const CXDChangeRecord& record) {
     if (name.isString()) addEach(group.arrayFor(kNames), Array{name});
     const char* list = listOf(record.type());
     if (!list || !record.person()) return;
-    const bool isGroup = list == kSubgroupAdds || list == kSubgroupRemoves;
-    group.arrayFor(list).append(shared(*record.person(), isGroup ? kCXGroupTable : kCXPersonTable));
+    group.arrayFor(list).append(shared(*record.person(), tableOf(list)));
 }
 
 bool isWrite(const CXDChangeRecord& record) {
@@ -80,6 +83,8 @@ public:
             if (record->group() && record->initialSource() == CXDSyncSourceVaultra &&
                 record->type() == CXDChangeGroupName)
                 _namesThere[shared(*record->group(), kCXGroupTable)] = record->inMemoryPayload();
+            if (const auto step = stepOf(*record); step && record->initialSource() == CXDSyncSourceVaultra)
+                _news[shared(*record->group(), kCXGroupTable)].insert(*step);
             if (record->type() == CXDDeleteGroup && record->group() && isWrite(*record))
                 _withdrawn.insert(cxUIDWithTableName(*record->group(), kCXGroupTable));
         }
@@ -124,7 +129,7 @@ public:
         const Array written = touched[kNames].array();
         // A name that the pass did not write comes from somebody else, who has seen the one that it wrote.
         if (!written.contains(name->second)) {
-            if (written.contains(here)) _renamedThere.insert(uid.str());
+            if (written.contains(here)) _renamedThere.set(uid.str(), name->second);
             return left;
         }
         _renamed.insert(uid.str());
@@ -134,20 +139,23 @@ public:
 
     CXDChangeRecords take() { return std::move(_records); }
 
-    // The same of a record that says more than the name.
+    // The same of a record that says more than the name. A group that is made has to have one.
     void overruleNameIn(CXDChangeRecordPtr& record) const {
         if (record->user() != _tree.user || !record->group()) return;
-        const bool isOurs = record->type() == CXDCompositeGroupChange && isWrite(*record);
-        const bool isTheirs =
-            record->type() == CXDCreateStructureForGroup && record->initialSource() == CXDSyncSourceVaultra;
-        if (!isOurs && !isTheirs) return;
-        if (!(isOurs ? _renamedThere : _renamed).contains(shared(*record->group(), kCXGroupTable))) return;
+        const bool makes = record->type() == CXDCreateStructureForGroup;
+        const bool isOurs = (makes || record->type() == CXDCompositeGroupChange) && isWrite(*record);
+        const bool isTheirs = makes && record->initialSource() == CXDSyncSourceVaultra;
+        const std::string group = shared(*record->group(), kCXGroupTable);
+        if (!(isOurs && _renamedThere.contains(group)) && !(isTheirs && _renamed.contains(group))) return;
         const Value content = record->inMemoryPayload();
         if (!content.isDictionary() || !content.dictionary().contains(kCXGroupNameProperty)) return;
-        Dictionary without = content.dictionary().mutableCopy();
-        without.remove(kCXGroupNameProperty);
+        Dictionary other = content.dictionary().mutableCopy();
+        if (isOurs && makes)
+            other.set(kCXGroupNameProperty, _renamedThere[group]);
+        else
+            other.remove(kCXGroupNameProperty);
         record = std::make_shared<CXDChangeRecord>(*record);
-        record->setPayload(without);
+        record->setPayload(other);
     }
 
     // Would it bring back, or take away, from the store what the database decides? Or name a group once more that
@@ -156,18 +164,21 @@ public:
         if (record.user() != _tree.user) return false;
         if (isWrite(record) && record.type() == CXDChangeGroupName && record.group())
             return _renamedThere.contains(shared(*record.group(), kCXGroupTable));
+        const auto step = stepOf(record);
+        if (isWrite(record) && step) return has(_arrived, shared(*record.group(), kCXGroupTable), *step);
         if (record.initialSource() != CXDSyncSourceVaultra) return false;
-        const bool isSubgroup = record.type() == CXDAddGroupToGroup || record.type() == CXDRemoveGroupFromGroup;
-        const std::string person =
-            record.person() ? shared(*record.person(), isSubgroup ? kCXGroupTable : kCXPersonTable) : std::string();
+        const std::string person = step              ? step->second
+                                   : record.person() ? shared(*record.person(), kCXPersonTable)
+                                                     : std::string();
         if (_gone.contains(person)) return true;
         if (!record.group()) return false;
         const std::string group = shared(*record.group(), kCXGroupTable);
         if (_gone.contains(group)) return true;
         if (record.type() == CXDChangeGroupName) return _renamed.contains(group);
-        const auto decided = _decided.find(group);
-        return decided != _decided.end() && decided->second.contains({record.type(), person});
+        return has(_decided, group, {record.type(), person});
     }
+    bool hasArrived() const { return !_arrived.empty(); }
+    const Dictionary& namesOfOthers() const { return _renamedThere; }
 
 private:
     struct Kind {
@@ -175,6 +186,17 @@ private:
         CXDChangeType add, remove;
         std::string_view table;
     };
+    using Step = std::pair<int32_t, std::string>;                  // a change of one member or subgroup
+    using Steps = std::unordered_map<std::string, std::set<Step>>; // by group
+    static bool has(const Steps& steps, const std::string& group, const Step& step) {
+        const auto of = steps.find(group);
+        return of != steps.end() && of->second.contains(step);
+    }
+    static std::optional<Step> stepOf(const CXDChangeRecord& record) {
+        const char* list = listOf(record.type());
+        if (!list || !record.person() || !record.group()) return std::nullopt;
+        return Step{record.type(), shared(*record.person(), tableOf(list))};
+    }
     UniqueId inDatabase(const UniqueId& group) const {
         return _tree.user == kSelf ? group : cxUIDWithTableName(group, kCXSubscribedGroupTable);
     }
@@ -188,17 +210,37 @@ private:
         auto& decided = _decided[group.str()];
         for (const Value& name : touched[kind.adds].array()) {
             decided.emplace(kind.add, name.string());
-            if (!there.contains(name.string()) && !members.containsString(name.string()))
+            if (members.containsString(name.string())) continue;
+            if (!there.contains(name.string()))
                 add(kind.remove, UniqueId(name.string()), group);
+            else
+                noteArrival(group, {kind.add, name.string()});
         }
         for (const Value& name : touched[kind.removes].array()) {
             decided.emplace(kind.remove, name.string());
-            if (!there.contains(name.string()) || !members.containsString(name.string())) continue;
+            if (!members.containsString(name.string())) continue;
+            if (!there.contains(name.string())) {
+                noteArrival(group, {kind.remove, name.string()});
+                continue;
+            }
             const UniqueId uid(name.string());
             const CXDChangeRecord removal(CXDSyncSourceCX, kind.remove, _tree.user, uid, group);
             didApplyChange(_conduitData, removal, CXDSyncSourceVaultra); // that may have come to its end
             add(kind.add, uid, group);
         }
+    }
+
+    // The store has the change as well as the database: it was written. A list of everybody says nothing of that, and
+    // nothing is said of somebody whom it does not know, because their own files may still have to be written.
+    void noteArrival(const UniqueId& group, const Step& step) {
+        if (group.str() == kCXAllGroupUID || !_known.contains(group.str()) || !has(_news, group.str(), step)) return;
+        const auto& [type, uid] = step;
+        const bool isSubgroup = tableOf(listOf(type)) == kCXGroupTable;
+        const Dictionary everybody = _known[kCXAllGroupUID].dictionary();
+        if (!everybody[isSubgroup ? kSubgroupUIDState : kMemberUIDState].array().containsString(uid)) return;
+        const CXDChangeRecord change(CXDSyncSourceCX, type, _tree.user, UniqueId(uid), group);
+        didApplyChange(_conduitData, change, CXDSyncSourceVaultra);
+        _arrived[group.str()].insert(step);
     }
 
     void add(CXDChangeType type, const std::optional<UniqueId>& person, const std::optional<UniqueId>& group,
@@ -213,11 +255,13 @@ private:
     const Dictionary _known; // by group
     CXRolvane& _rolvane;
     Holdings _holdings;
-    std::unordered_set<std::string> _gathered, _gone, _renamed, _renamedThere;
+    std::unordered_set<std::string> _gathered, _gone, _renamed;
+    Dictionary _renamedThere; // by group: the name that somebody else gave it
     std::unordered_set<UniqueId> _withdrawn;
     std::unordered_map<std::string, Value> _namesThere; // that the store has and that are not known, by group
-    // By group: the changes of members and subgroups that the pass was to make.
-    std::unordered_map<std::string, std::set<std::pair<int32_t, std::string>>> _decided;
+    Steps _decided;                                     // that the pass was to make
+    Steps _news;                                        // in which the store differs from what is known
+    Steps _arrived;                                     // of both
     CXDChangeRecords _records;
 };
 
@@ -293,6 +337,16 @@ Dictionary underWayTogether(const Dictionary& former, const Dictionary& latter) 
     return both;
 }
 
+Dictionary withoutNames(const Dictionary& underWay, const Dictionary& namesOfOthers) {
+    if (namesOfOthers.empty()) return underWay;
+    const Dictionary without = Value(underWay).deepMutableCopy().dictionary();
+    for (const auto& [user, of] : without)
+        for (const auto& [group, touched] : of.dictionary()[kGroups].dictionary())
+            if (touched.dictionary().contains(kNames) && namesOfOthers.contains(group))
+                touched.dictionary()[kNames].array().removeAll(namesOfOthers[group]);
+    return without;
+}
+
 std::unordered_set<UniqueId> removedBy(const CXDChangeRecords& records) {
     std::unordered_set<UniqueId> removed;
     for (const CXDChangeRecordPtr& record : records) {
@@ -329,8 +383,8 @@ Dictionary adrift(const Dictionary& underWay, const Dictionary& conduitData, con
     return left.empty() ? end.unread : underWayTogether(end.unread, Dictionary{{kSelf.str(), left}});
 }
 
-Dictionary settleUnderWay(const Dictionary& underWay, const SharedTree& tree, CXDChangeRecords& records, size_t fresh,
-                          Dictionary& conduitData, CXRolvane& rolvane) {
+SettledUnderWay settleUnderWay(const Dictionary& underWay, const SharedTree& tree, CXDChangeRecords& records,
+                               size_t fresh, Dictionary& conduitData, CXRolvane& rolvane) {
     Settlement settlement(records, fresh, tree, conduitData, rolvane);
     const Dictionary of = underWay[tree.user.str()].dictionary();
     Dictionary left;
@@ -343,7 +397,7 @@ Dictionary settleUnderWay(const Dictionary& underWay, const SharedTree& tree, CX
     std::erase_if(records, [&](const CXDChangeRecordPtr& record) { return settlement.isOverruled(*record); });
     for (CXDChangeRecordPtr& record : records) settlement.overruleNameIn(record);
     for (CXDChangeRecordPtr& record : settlement.take()) records.push_back(std::move(record));
-    return left;
+    return {left, settlement.hasArrived(), settlement.namesOfOthers()};
 }
 
 } // namespace rolvane

@@ -21,6 +21,8 @@ class CXRolvane;
 // "subgroupAdds", "subgroupRemoves", "names": likewise}}}}; empty when there is nothing to remember.
 Dictionary underWay(const CXDChangeRecords& records);
 inline constexpr const char* kSubscription = "subscription"; // to the tree of somebody else; set by the caller
+// Without those names, by group, which are not the pass's own.
+Dictionary withoutNames(const Dictionary& underWay, const Dictionary& namesOfOthers);
 // A note of an earlier version knew the own tree alone, and had no user in it.
 Dictionary underWayInAnyForm(const Dictionary& stored);
 // Both together; neither is changed.
@@ -35,9 +37,15 @@ struct SharedTree {
 // removed from the store, members are put in or taken out, names are set that the pass may have written. The records
 // for it are added to `records`, which is what the pass has gathered, `fresh` of them, and the queue; and those are
 // taken out by which the store would bring the same back. Of groups only those are spoken of that are shared still,
-// which is to say that they are known or gathered. Gives what of it cannot be settled before the tree is read.
-Dictionary settleUnderWay(const Dictionary& underWay, const SharedTree& tree, CXDChangeRecords& records, size_t fresh,
-                          Dictionary& conduitData, CXRolvane& rolvane);
+// which is to say that they are known or gathered. What the store and the database agree upon by now has arrived, and
+// is folded into both prior states.
+struct SettledUnderWay {
+    Dictionary left;          // of it: what cannot be settled before the tree is read
+    bool hasArrived = false;  // the prior states say so; a later pass cannot see it any more once somebody undoes it
+    Dictionary namesOfOthers; // group to the name that somebody else gave it, which a record of the pass may repeat
+};
+SettledUnderWay settleUnderWay(const Dictionary& underWay, const SharedTree& tree, CXDChangeRecords& records,
+                               size_t fresh, Dictionary& conduitData, CXRolvane& rolvane);
 
 // What is known at the end of a pass, identifiers in their shared form.
 struct PassEnd {
