@@ -6,7 +6,6 @@
 #include <map>
 #include <memory>
 #include <optional>
-#include <set>
 #include <string>
 #include <vector>
 
@@ -140,8 +139,12 @@ protected:
     virtual WithdrawalNotice* withdrawalNotice() const; // base: none; nothing is kept and nobody is told
     // Whether the state that was just read of a user's store is to be believed. Base: always.
     virtual bool isTrusted(const UserName& user, const Dictionary& state);
-    // Is the tree, and all that a comparison with it looks at, as it was when one found nothing? Then none is made.
-    virtual bool isUnchanged(const UserName& /*user*/, const Url& /*base*/) { return false; }
+    // What the tree holds other than when a comparison with it found nothing, where that is contacts alone and nothing
+    // else that a comparison looks at has changed: contact -> {"modificationdate"}, as in a per-user state. None is
+    // made then. Nothing: the tree is to be compared. Base: nothing.
+    virtual std::optional<Dictionary> contactsChangedAlone(const UserName& /*user*/, const Url& /*base*/) {
+        return std::nullopt;
+    }
     // The store forbids or has lost the owner's published tree, or (`replaced`) has another one. Called before anything
     // of the publication is forgotten. Base: nothing.
     virtual void ownPublicationEnds(const Url& /*base*/, bool /*replaced*/) {}
@@ -154,7 +157,7 @@ protected:
     std::optional<std::map<std::string, std::shared_ptr<CXACLManager>>> _ACLManagerMap;
 
 private:
-    std::set<UserName> _unchanged; // of the state that was read last: left out of it, as there is no need to compare
+    std::map<UserName, Dictionary> _changedAlone;  // trees that were left out of the state, with their changed contacts
     std::vector<RemoteLocation> locationsToRead(); // the owner's first; also tells the engine of the subscriptions
     // `allIsNew`: every contact is going to be read, so that it can begin while the listing is under way.
     std::optional<Dictionary> fetchWorkingState(const Url& base, bool* forbidden, bool allIsNew);

@@ -44,6 +44,8 @@ bool isARecordsName(const UniqueId& uid);
 // slashes, not the name of a hidden file.
 bool isASoundName(std::string_view name);
 
+inline constexpr uint64_t kLargestFile = 64u << 20; // bytes; as much of an answer as is ever read
+
 // The group state after a composite change; `state` and `payload` stay as they are. Additions come before removals, a
 // member is listed once however often it is added, a removal takes out every occurrence, and the three containers
 // exist afterwards. A part of either that is of another kind than expected counts as empty.

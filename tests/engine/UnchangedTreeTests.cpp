@@ -46,6 +46,56 @@ TEST_F(UnchangedTrees, AnEditIsSentWithSixRequestsAndAReadWhereOthersMayWrite) {
     EXPECT_EQ(copies(), alice.view());
 }
 
+// Whoever compares a tree asks for its "info" first.
+TEST_F(UnchangedTrees, AnEditThatIsReadIsComparedAlone) {
+    settle();
+    for (const char* name : {"Benjamin", "Benno", "Benedikt"}) {
+        people[1]->setValue(Value(name), kCXFirstNameProperty);
+        alice.application->save();
+        ASSERT_TRUE(alice.database->deliverExternalChanges());
+        for (Participant* user : {&bob, &alice, &bob, &alice}) {
+            user->wire->clear();
+            user->pass();
+            EXPECT_EQ(user->reads("/info"), 0u) << name << ", " << user->name << "\n" << user->wire->text();
+        }
+        EXPECT_EQ(copies(), alice.view());
+    }
+}
+
+// The contact that could not be read stands out at the next look, too, whatever else has changed by then.
+TEST_F(UnchangedTrees, AnEditThatCouldNotBeReadComesLater) {
+    settle();
+    writeElsewhere(people[1], "Benjamin");
+    bob.wire->intercept([](const HttpRequest& request) -> std::optional<HttpResponse> {
+        const bool isContact = request.method == "GET" && request.url.path().find("People") != std::string::npos;
+        return isContact ? std::optional(answerOf(503)) : std::nullopt;
+    });
+    bob.pass();
+    EXPECT_NE(firstName(bob.copyOf(people[1])), Value("Benjamin"));
+    writeElsewhere(people[2], "Cleopatra");
+    bob.pass();
+    bob.wire->intercept({});
+    bob.pass();
+    for (int i = 0; i < 2; ++i)
+        for (Participant* user : {&alice, &bob}) user->pass();
+    EXPECT_EQ(copies(), alice.view());
+    EXPECT_EQ(firstName(bob.copyOf(people[1])), Value("Benjamin"));
+    EXPECT_EQ(firstName(bob.copyOf(people[2])), Value("Cleopatra"));
+}
+
+// Somebody has deleted the copy meanwhile, so that the edit alone does not tell how the trees differ.
+TEST_F(UnchangedTrees, AnEditOfAContactThatIsNotHereIsComparedWithAll) {
+    settle();
+    writeElsewhere(people[1], "Benjamin");
+    bob.application->removeRecord(bob.copyOf(people[0]));
+    bob.application->save();
+    bob.wire->clear();
+    bob.pass();
+    EXPECT_GT(bob.reads("/info"), 0u) << bob.wire->text();
+    for (int i = 0; i < 2; ++i) bothPass();
+    EXPECT_EQ(copies(), alice.view());
+}
+
 // The cache that knows them is gone. What lies in a tree that nobody else writes to is no news, and is not read.
 TEST_F(UnchangedTrees, VersionsThatAreForgottenAreNotReadAnewWhereNobodyElseWrites) {
     alice.application->allGroup()->setValue(CXMutableMultiValue(), kCXReadWriteSharingACLProperty);

@@ -5,12 +5,15 @@
 #include "store/dav/CXDAVManager.h"
 #include "store/reads/GroupCopies.h"
 #include "store/reads/ListingMemory.h"
+#include "store/reads/VersionMemory.h"
 #include "support/TempHome.h"
 
+#include <algorithm>
 #include <filesystem>
 #include <gtest/gtest.h>
 #include <map>
 #include <rapidcheck/gtest.h>
+#include <set>
 
 using namespace rolvane;
 using namespace rolvane::test;
@@ -142,9 +145,113 @@ TEST(ListingMemory, IsTheSameBehindAFile) {
     for (const Url& container : {kTree, people}) EXPECT_EQ(shown(other, container), shown(memory, container));
     EXPECT_NE(shown(other, people).find("urn:token:17\n"), std::string::npos);
     EXPECT_EQ(other.saved(), "") << "nobody has used the tree in this process";
-    other.keepToken(kTree, "urn:token:18", false);
+    other.keepToken(kTree, "urn:token:18", ListingMemory::Files(std::in_place));
     ASSERT_TRUE(unused.restore(other.saved()));
     EXPECT_EQ(unused.token(kTree), "urn:token:18");
+}
+
+// One member after the other gives what keeping the whole anew does.
+RC_GTEST_PROP(ListingMemory, EditedIsAsKeptAnew, ()) {
+    const Url people = kTree.cxURLByAppendingComponent("People");
+    ListingMemory::Entries entries = entriesBelow(people, 300, 1);
+    ListingMemory edited, anew;
+    edited.keep(people, ListingMemory::kSynced, entries);
+    for (int version = 2; version < 12; ++version) {
+        ListingMemory::Edits edits;
+        std::map<std::string, std::string> expected, told;
+        const auto tagOf = [](const std::optional<MultistatusEntry>& e) { return e ? e->etag.str() : "-"; };
+        for (const size_t i : *rc::gen::container<std::set<size_t>>(8, rc::gen::inRange<size_t>(0, 400))) {
+            const Url url = people.cxURLByAppendingComponent("ü" + std::to_string(i) + ":CXPerson");
+            const std::string name = url.absoluteString().substr(url.absoluteString().rfind('/') + 1);
+            std::optional<MultistatusEntry> now;
+            if (*rc::gen::inRange(0, 4) != 0) {
+                now.emplace();
+                now->etag = EntityTag(std::string(*rc::gen::inRange<size_t>(1, 9), 't') + std::to_string(version));
+                now->length = i;
+            }
+            edits[name] = now;
+            const auto held = std::find_if(entries.begin(), entries.end(), [&](const auto& each) {
+                return each.first.absoluteString() == url.absoluteString();
+            });
+            expected[name] = (held == entries.end() ? "-" : held->second.etag.str()) + " " + tagOf(now);
+            if (held != entries.end() && now) held->second = *now;
+            if (held != entries.end() && !now) entries.erase(held);
+        }
+        for (const auto& [name, now] : edits) { // new ones come last, by name
+            const Url url(people.absoluteString() + "/" + name);
+            const bool isHeld = std::any_of(entries.begin(), entries.end(), [&](const auto& each) {
+                return each.first.absoluteString() == url.absoluteString();
+            });
+            if (now && !isHeld) entries.emplace_back(url, *now);
+        }
+        RC_ASSERT(edited.edit(people, ListingMemory::kSynced, edits,
+                              [&](const auto& name, const auto& before, const auto& now) {
+                                  told[name] = tagOf(before) + " " + tagOf(now);
+                              }));
+        RC_ASSERT(told == expected);
+        anew.keep(people, ListingMemory::kSynced, entries);
+        RC_ASSERT(shown(edited, people) == shown(anew, people));
+        for (const auto& [name, now] : edits)
+            RC_ASSERT(tagOf(edited.member(people, ListingMemory::kSynced, name)) == tagOf(now));
+    }
+    RC_ASSERT(!edited.edit(kTree, ListingMemory::kSynced, {}, {}));
+}
+
+TEST(ListingMemory, TellsTheFilesThatHaveChangedSinceAState) {
+    ListingMemory memory;
+    using Files = std::vector<std::string>;
+    memory.keepToken(kTree, "1");
+    const uint64_t first = memory.stateOf(kTree);
+    EXPECT_EQ(memory.filesChangedSince(kTree, first), Files());
+    memory.keepToken(kTree, "2", Files());
+    EXPECT_EQ(memory.stateOf(kTree), first) << "the clock file alone";
+    memory.keepToken(kTree, "3", Files{"a", "b"});
+    const uint64_t second = memory.stateOf(kTree);
+    EXPECT_NE(second, first);
+    memory.keepToken(kTree, "4", Files{"c"});
+    EXPECT_EQ(memory.filesChangedSince(kTree, first), (Files{"a", "b", "c"}));
+    EXPECT_EQ(memory.filesChangedSince(kTree, second), Files{"c"});
+    EXPECT_EQ(memory.filesChangedSince(kTree, first - 1), std::nullopt) << "before the tree was listed";
+    memory.keepToken(kTree, "5", std::nullopt); // a group, or somebody new
+    EXPECT_EQ(memory.filesChangedSince(kTree, second), std::nullopt);
+    const uint64_t third = memory.stateOf(kTree);
+    for (int i = 0; i < 300; ++i) memory.keepToken(kTree, "6", Files{std::to_string(i)});
+    EXPECT_EQ(memory.filesChangedSince(kTree, third), std::nullopt) << "too many";
+    ASSERT_TRUE(memory.filesChangedSince(kTree, memory.stateOf(kTree) - 1));
+    const uint64_t last = memory.stateOf(kTree);
+    memory.forgetBelow(kTree);
+    EXPECT_EQ(memory.filesChangedSince(kTree, last), std::nullopt);
+    memory.keepToken(kTree, "7", Files{"d"});
+    EXPECT_EQ(memory.filesChangedSince(kTree, last), std::nullopt) << "listed anew";
+}
+
+TEST(VersionMemory, NamesTheLastURLsOfWhichSomethingHasBecomeKnown) {
+    VersionMemory memory({}, 1000);
+    const auto read = [&](const std::string& url, int version) {
+        memory.read(url, {EntityTag("\"" + std::to_string(version) + "\""), std::nullopt, 1});
+    };
+    using Names = std::vector<std::string>;
+    memory.belongTo({1, 1});
+    read("a", 1);
+    const uint64_t first = memory.changes();
+    read("a", 1);
+    read("x/dateFile", 1);
+    EXPECT_EQ(memory.changedSince(first), Names()) << "nothing new, and a clock file";
+    read("b", 1);
+    memory.forget("a");
+    memory.wrote("c", EntityTag("\"1\""), std::nullopt, "content");
+    EXPECT_EQ(memory.changedSince(first), (Names{"b", "a", "c"}));
+    EXPECT_EQ(memory.changedSince(memory.changes()), Names());
+    for (int i = 0; i < 400; ++i) read("d" + std::to_string(i), 1);
+    EXPECT_EQ(memory.changedSince(first), std::nullopt) << "too many";
+    EXPECT_EQ(memory.changedSince(memory.changes() - 1), Names{"d399"});
+    const uint64_t before = memory.changes();
+    memory.revert();
+    EXPECT_EQ(memory.changedSince(before), std::nullopt) << "nobody knows which";
+    VersionMemory small({}, 2);
+    const uint64_t none = small.changes();
+    for (const char* url : {"a", "b", "c"}) small.read(url, {EntityTag("\"1\""), std::nullopt, 1});
+    EXPECT_EQ(small.changedSince(none), std::nullopt) << "one has gone for want of room";
 }
 
 RC_GTEST_PROP(ListingMemory, TakesNothingOverFromADamagedText, ()) {

@@ -1,5 +1,6 @@
 #include "conduits/database/CXDCXConduit.h"
 
+#include "conduits/EditsAlone.h"
 #include "conduits/PublishedLayout.h"
 #include "conduits/TakingIn.h"
 #include "conduits/database/ChangeCapture.h"
@@ -16,6 +17,8 @@
 #include "model/PayloadKeys.h"
 #include "model/RemoteLocationMap.h"
 
+#include <algorithm>
+
 namespace rolvane {
 namespace {
 
@@ -25,6 +28,11 @@ constexpr size_t kMany = 16;
 // Whatever such an identifier finds is a person, whose row is all that is needed of it.
 bool namesPerson(const UniqueId& uid) {
     return uid.endsWith("Person");
+}
+
+// As an edited contact makes them, and no comparison of an all-contacts group.
+bool isOfOnePerson(const CXDChangeRecordPtr& record) {
+    return record->type() == CXDUpdateRecord || record->type() == CXDUpdateDistributionList;
 }
 
 template <class GroupClass>
@@ -111,7 +119,8 @@ CXDChangeRecords CXDCXConduit::changeRecords() {
     const Date ownSince = everything || hasTakenIn ? Date::distantPast() : since;
     const auto states = engine().stateGeneration();
     const auto now = states ? std::optional(Moment{scan.journalPosition, *states}) : std::nullopt;
-    const bool isAsBefore = now && !everything && now == _foundNothing;
+    const bool isAsBefore = now && !everything && _foundNothing && now->states == _foundNothing->states &&
+                            areEditsOfPeopleAlone(rolvane(), _foundNothing->journal, now->journal);
 
     ChangeCapture capture = newCapture();
     capture.reader().expectMany();
@@ -147,7 +156,8 @@ CXDChangeRecords CXDCXConduit::changeRecords() {
     _scan = scan;
     _editsKnown = scan.journalPosition;
     CXDChangeRecords records = capture.take();
-    _foundNothing = records.empty() ? now : std::nullopt;
+    const bool foundNothing = std::all_of(records.begin(), records.end(), isOfOnePerson);
+    _foundNothing = foundNothing ? now : std::nullopt;
     return records;
 }
 

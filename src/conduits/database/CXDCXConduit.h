@@ -134,7 +134,7 @@ private:
         Date since;
     };
 
-    // All that a scan of the all-contacts groups looks at; equal ones find the same.
+    // All that a scan of the all-contacts groups looks at. Equal ones find the same, and edits of people alone.
     struct Moment {
         int64_t journal = 0;
         uint64_t states = 0;

@@ -22,7 +22,6 @@ namespace {
 
 constexpr int kForbidden = 403;
 constexpr int kNotFound = 404;
-constexpr uint64_t kLargestFile = 64u << 20; // bytes; as much of an answer as is ever read
 constexpr std::string_view kGroupSuffix = "CXGroup";
 constexpr std::string_view kPersonSuffix = "CXPerson";
 
@@ -85,7 +84,7 @@ void expectContacts(CXFileManager& manager, const Url& base, const FileListing& 
     for (const auto& [path, file] : part) {
         const std::string name = nameOf(path, file);
         if (name.ends_with(kPersonSuffix) && layout::isASoundName(name) && file.modificationdate &&
-            file.size <= kLargestFile)
+            file.size <= layout::kLargestFile)
             contacts.push_back(layout::contactLocation(base, UniqueId(name)));
     }
     manager.expectSomeReads(contacts, true); // payloads are read securely
@@ -119,7 +118,7 @@ std::vector<RemoteLocation> CXDConduit::locationsToRead() {
 
 Dictionary CXDConduit::currentState() {
     Dictionary state;
-    _unchanged.clear();
+    _changedAlone.clear();
     if (!conduitID() || conduitSource() == 0) return state; // no source of its own
     for (const RemoteLocation& location : locationsToRead()) readLocation(location, state);
     return state;
@@ -128,11 +127,11 @@ Dictionary CXDConduit::currentState() {
 void CXDConduit::readLocation(const RemoteLocation& location, Dictionary& state) {
     const UserName user = _engine.userForRemoteLocation(location);
     // A location that names nobody cannot be read.
-    if (user.empty() || state.contains(user.str()) || _unchanged.contains(user)) return;
+    if (user.empty() || state.contains(user.str()) || _changedAlone.contains(user)) return;
     const auto base = baseLocationForUser(realUserFromUser(user));
     if (!base) return;
-    if (isUnchanged(user, *base)) {
-        _unchanged.insert(user);
+    if (auto contacts = contactsChangedAlone(user, *base)) {
+        _changedAlone.emplace(user, *std::move(contacts));
         return _engine.treeWasLookedAt(user, TreeLook::read);
     }
     bool forbidden = true;
@@ -201,7 +200,7 @@ std::optional<Dictionary> CXDConduit::fetchWorkingState(const Url& base, bool* f
         // Groups lie beside "People": what is called like one among the contacts could not be read as one.
         if (!layout::isASoundName(name) || (isGroup && path.starts_with(bucketsPath))) {
             CXLog("An entry with a strange name in %@ is left out: %@", base, shown(name));
-        } else if (file.size > kLargestFile) {
+        } else if (file.size > layout::kLargestFile) {
             CXLog("An entry in %@ is too large to be read and left out: %@", base, shown(name));
         } else if (isGroup) {
             Dictionary groupState;
@@ -272,9 +271,17 @@ CXDChangeRecords CXDConduit::comparePriorStateToCurrentState(const Dictionary& p
 
 void CXDConduit::compareUser(const UserName& user, const Dictionary& prior, const Dictionary& current,
                              CXDChangeRecords& records) {
-    if (_unchanged.contains(user)) {
-        const auto lists = changeRecordsForACLAtRemoteLocation(*baseLocationForUser(user));
+    if (const auto alone = _changedAlone.find(user); alone != _changedAlone.end()) {
+        const Url base = *baseLocationForUser(user);
+        const auto lists = changeRecordsForACLAtRemoteLocation(base);
         records.insert(records.end(), lists.begin(), lists.end());
+        if (alone->second.empty()) return;
+        StoreUser who{user, RemoteLocation(base.absoluteString()), conduitSource(), false, _lastSyncDate, {}, {}};
+        who.contactUpdate = [&](const UniqueId& contact) { return contactUpdate(user, who.base, contact); };
+        Dictionary now;
+        now.dictionaryFor(kPeopleState).set(kMemberUIDState, alone->second);
+        const CXDChangeRecords changes = compareStoreStates({}, now, who);
+        records.insert(records.end(), changes.begin(), changes.end());
         return;
     }
     const Dictionary now = current[user.str()].dictionary();

@@ -131,6 +131,7 @@ void CXDVaultraConduit::open() {
     _setBack.clear();
     _writtenInOrder.clear();
     _compared.clear(); // of a pass that failed
+    _lookedAt.clear();
     _isOlderCopy = engine().conduitObjectForKey(kConduitCX, kPublishAgain)[kOlderCopy].boolean();
     const int code = testReachability(gathering ? [this] { beginReading(); } : std::function<void()>());
     if (code == kCXDAVErrorAuthentication) {

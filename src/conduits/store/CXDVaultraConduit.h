@@ -127,10 +127,11 @@ protected:
     // A tree that was set back or has lost its lists says nothing about anybody's contacts, and is left alone. The
     // owner's own is published again.
     bool isTrusted(const UserName& user, const Dictionary& state) override;
-    bool isUnchanged(const UserName& user, const Url& base) override;
+    std::optional<Dictionary> contactsChangedAlone(const UserName& user, const Url& base) override;
 
 private:
-    // All that a comparison of a tree with what is known of it looks at; equal ones find the same.
+    // All that a comparison of a tree with what is known of it looks at; equal ones find the same. Edits of contacts
+    // that the database has, here or there, change nothing but whether these contacts are to be read.
     struct Comparison {
         int64_t journal = 0;
         uint64_t states = 0;
@@ -138,6 +139,7 @@ private:
         bool operator==(const Comparison&) const = default;
     };
     std::optional<Comparison> comparisonWith(const UserName& user, const Url& base, bool ask);
+    std::optional<Dictionary> contactsChangedSince(const UserName& user, const Url& base, const Comparison& before);
     void noteWithoutChanges(int64_t journal, const std::set<UserName>& changed);
     void beginReading();
     void lookAfterStructure(bool meanwhile); // while the pass goes on
@@ -215,7 +217,8 @@ private:
     std::set<UniqueId> _foundAgain;               // contacts that the next look takes away, too; of this gathering
     std::map<UserName, Dictionary> _read;         // so far: the states of known users
     std::map<UserName, Comparison> _foundNothing; // the last comparisons that found nothing
-    std::map<UserName, Comparison> _compared;     // those of the gathering that is under way
+    std::map<UserName, Comparison> _compared;     // those that the gathering under way has not made again
+    std::map<UserName, Comparison> _lookedAt;     // and what it has seen of these trees
     bool _gathering = false;                      // `open` belongs to a gathering
     Mutex _structureLock;
     std::future<void> _structure GUARDED_BY(_structureLock); // the look at the own tree that is under way

@@ -3,6 +3,7 @@
 
 #include "conduits/store/CXDVaultraConduit.h"
 
+#include "conduits/EditsAlone.h"
 #include "conduits/PublishedLayout.h"
 #include "conduits/TakingIn.h"
 #include "conduits/store/EndedPublication.h"
@@ -105,24 +106,45 @@ std::optional<CXDVaultraConduit::Comparison> CXDVaultraConduit::comparisonWith(c
     return tree ? std::optional(Comparison{_world.rolvane.journalPosition(), *states, *tree}) : std::nullopt;
 }
 
-bool CXDVaultraConduit::isUnchanged(const UserName& user, const Url& base) {
+std::optional<Dictionary> CXDVaultraConduit::contactsChangedAlone(const UserName& user, const Url& base) {
     const auto before = _foundNothing.find(user);
-    if (user == kSelf && _isOneOfSeveral) {
-        const Dictionary known = engine().conduitObjectForKey(kConduitVaultra, kPriorState)[user.str()].dictionary();
-        if (isToTellAgain(known[kSerialNumber])) return false;
-    }
-    if (before == _foundNothing.end() || comparisonWith(user, base, true) != before->second) return false;
     const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
-    Dictionary prior = users[user.str()].dictionary();
+    const Dictionary* known = users[user.str()].dictionaryIf();
+    if (before == _foundNothing.end() || !known || known->contains(kAllIsNew)) return std::nullopt;
+    if (user == kSelf && (_takesIn || (_isOneOfSeveral && isToTellAgain((*known)[kSerialNumber])))) return std::nullopt;
+    const auto now = comparisonWith(user, base, true);
+    if (!now || now->states != before->second.states ||
+        !areEditsOfPeopleAlone(_world.rolvane, before->second.journal, now->journal))
+        return std::nullopt;
+    std::optional<Dictionary> contacts = contactsChangedSince(user, base, before->second);
+    if (!contacts) return std::nullopt;
+    Dictionary prior = *known;
     Dictionary dates;
     for (const auto& [file, date] : _world.manager.datesOfTree(base)) dates.set(file, date);
     if (!treeCondition({{kTreeDates, prior[kTreeDates].dictionary()}}, {{kTreeDates, dates}},
                        user == kSelf ? _lastSyncDate : std::nullopt)
              .isSound())
-        return false;
+        return std::nullopt;
     prior.set(kTreeDates, dates);
     _compared.insert(*before);
-    return true;
+    _lookedAt.insert_or_assign(user, *now);
+    return contacts;
+}
+
+// Contacts that the database does not have are a matter of the lists that name them.
+std::optional<Dictionary> CXDVaultraConduit::contactsChangedSince(const UserName& user, const Url& base,
+                                                                  const Comparison& before) {
+    const auto files = _world.manager.contactsChangedSince(base, before.tree);
+    if (!files) return std::nullopt;
+    Dictionary contacts;
+    for (const auto& [path, file] : *files) {
+        const UniqueId name(file.displayName);
+        if (!name.endsWith(kCXPersonTable) || !layout::isASoundName(name.str()) || !file.modificationdate ||
+            file.size > layout::kLargestFile || !_world.rolvane.recordForUniqueId(nameInDatabase(user, name)))
+            return std::nullopt;
+        contacts.set(name.str(), Dictionary{{kModificationDate, *file.modificationdate}});
+    }
+    return contacts;
 }
 
 // `journal`: as it was when the trees were read; `changed`: for whom there is anything to be done.
@@ -132,6 +154,9 @@ void CXDVaultraConduit::noteWithoutChanges(int64_t journal, const std::set<UserN
             if (const auto base = baseLocationForUser(realUserFromUser(user)))
                 if (const auto compared = comparisonWith(user, *base, false))
                     _compared.emplace(user, Comparison{journal, compared->states, compared->tree});
+    // Where a contact was found, the next look begins at the same moment, and finds whether it was taken in.
+    for (auto& [user, now] : std::exchange(_lookedAt, {}))
+        if (!changed.contains(user)) _compared.insert_or_assign(user, Comparison{journal, now.states, now.tree});
     _foundNothing = std::exchange(_compared, {});
 }
 

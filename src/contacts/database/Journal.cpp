@@ -1,5 +1,6 @@
 #include "contacts/database/Journal.h"
 
+#include <algorithm>
 #include <map>
 
 namespace rolvane {
@@ -7,6 +8,7 @@ namespace rolvane {
 namespace {
 
 constexpr int kSavesKept = 1000;
+constexpr int64_t kEntriesKept = 1000;  // however far the cursors are
 constexpr int64_t kBooksMayLag = 10000; // entries
 
 CXJournalEntry entryAt(const Sqlite::Statement& s) {
@@ -107,6 +109,7 @@ void Journal::prune() {
             "ELSE seq END) FROM cursors), (SELECT max(seq) - 1000 FROM journal), 0)");
         if (s.bind(1, kCXBooksProgram).bind(2, kBooksMayLag).step()) passed = s.integer(0);
     }
+    passed = std::min(passed, position() - kEntriesKept);
     _database.statement("DELETE FROM journal WHERE seq<=?").bind(1, passed).run();
     int64_t needed = _database.integer("SELECT coalesce((SELECT save FROM journal ORDER BY seq LIMIT 1), 1 << 62)");
     auto s = _database.statement("DELETE FROM saves WHERE id<? AND id<=(SELECT max(id) FROM saves)-?");

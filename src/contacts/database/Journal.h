@@ -33,7 +33,7 @@ public:
     // Within a transaction.
     int64_t beginSave(int64_t processID, const std::string& program, Date date);
     void note(int64_t save, const UniqueId& uid, CXChangeKind kind);
-    void prune(); // what every cursor has passed
+    void prune(); // what every cursor has passed, but for the last 1,000 entries
 
 private:
     Sqlite& _database;

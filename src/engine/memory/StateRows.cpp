@@ -21,6 +21,14 @@ std::string rowOf(const std::string& conduit, const std::string& user, const std
     return key;
 }
 
+// A mark that has been dealt with stays as an empty dictionary, or goes; both say the same.
+Dictionary ofContent(const Dictionary& marks) {
+    Dictionary content;
+    for (const auto& [key, value] : marks)
+        if (!value.isDictionary() || !value.dictionaryIf()->empty()) content.set(key, value);
+    return content;
+}
+
 } // namespace
 
 bool isStateRow(std::string_view key) {
@@ -34,7 +42,7 @@ StateRows stateRows(const Dictionary& conduitData) {
     for (const std::string conduit : kConduits) {
         const Value& of = conduitData[conduit];
         if (!of.isDictionary() || !of.dictionary()[kPriorState].isDictionary()) continue;
-        Dictionary without = of.dictionary().mutableCopy();
+        Dictionary without = ofContent(of.dictionary());
         Dictionary users;
         for (const auto& [user, groups] : of.dictionary()[kPriorState].dictionary()) {
             users.set(user, Dictionary()); // whoever is known without any group is known

@@ -339,6 +339,17 @@ std::optional<CXDAVManager::TreeMark> CXDAVManager::markOfTree(const Url& tree, 
     return listing == 0 ? std::nullopt : std::optional(TreeMark{listing, _impl->versions.changes()});
 }
 
+std::optional<FileListing> CXDAVManager::contactsChangedSince(const Url& tree, const TreeMark& mark) {
+    StoreListing::AskedRef asked;
+    {
+        const Lock guard(_impl->begunLock);
+        const auto found = _impl->begunListings.find(tree.absoluteString());
+        if (found != _impl->begunListings.end()) asked = found->second;
+    }
+    return StoreListing(_impl->session, _impl->versions, _impl->listings())
+        .contactsChangedSince(tree, asked, mark.listing, mark.versions);
+}
+
 std::map<std::string, Date> CXDAVManager::datesOfTree(const Url& tree) {
     std::map<std::string, Date> dates;
     _impl->listings().forEach(tree, ListingMemory::kSynced, [&](const ListingMemory::Member& member) {

@@ -8,6 +8,7 @@
 
 #include <algorithm>
 #include <deque>
+#include <set>
 
 namespace rolvane {
 
@@ -312,6 +313,31 @@ bool StoreListing::bringUpToDate(const Url& tree, AskedRef& begun) {
     if (begun->isTakenIn) return true;
     begun.reset();
     return false;
+}
+
+std::optional<FileListing> StoreListing::contactsChangedSince(const Url& tree, const AskedRef& begun, uint64_t listing,
+                                                              uint64_t versions) {
+    const auto files = _listings.filesChangedSince(tree, listing);
+    const auto known = _versions.changedSince(versions);
+    if (!files || !known) return std::nullopt;
+    std::set<std::string> names(files->begin(), files->end());
+    for (const std::string& url : *known)
+        if (url.starts_with(tree.absoluteString() + "/")) names.insert(url);
+    FileListing out;
+    const Url people = tree.cxURLByAppendingComponent("People");
+    for (const std::string& name : names) {
+        const Url url(name);
+        const Url bucket = url.cxURLByDeletingLastComponent();
+        if (!isMember(bucket, people)) return std::nullopt;
+        const auto entry =
+            _listings.member(bucket, ListingMemory::kSynced, std::string_view(name).substr(name.rfind('/') + 1));
+        if (!entry || entry->isCollection) return std::nullopt;
+        FileInfo info;
+        info.displayName = url.cxLastComponent();
+        stamp(name, *entry, begun ? begun->serverDate : std::nullopt, info);
+        out[pathOf(url)] = std::move(info);
+    }
+    return out;
 }
 
 // The tree as the memory has it, once that is up to date.

@@ -38,6 +38,11 @@ public:
     // infoForFilesInContainerByParts.
     std::optional<FileListing> list(const Url& container, const AskedRef& begun = {},
                                     const CXFileManager::ListingPart& part = {});
+    // Of a tree that was brought up to date, the entries of contact files that may be different from those of a listing
+    // at an earlier moment: in that state of the memory of listings, with so many changes of known versions. Nothing
+    // where anything else may be different, too.
+    std::optional<FileListing> contactsChangedSince(const Url& tree, const AskedRef& begun, uint64_t listing,
+                                                    uint64_t versions);
     // The names of the direct members of each container, with what they are. Nothing for a container that cannot be
     // listed; `codes` tells why.
     struct Members {

@@ -58,9 +58,13 @@ bool isSameVersion(const MultistatusEntry& a, const MultistatusEntry& b) {
 }
 
 struct Edits {
-    std::map<std::string, std::optional<MultistatusEntry>> members; // by the name's text; nothing: departed
+    ListingMemory::Edits members;
     Url container;
 };
+
+bool isBucket(const std::vector<std::string>& below) {
+    return below.size() == 2 && below.front() == "People";
+}
 
 } // namespace
 
@@ -119,8 +123,8 @@ bool SyncedListing::take(const Url& tree, const HttpResponse& answer, bool& isCu
     if (!applied) return false;
     isCut = applied->isCut;
     if (isCut && reader.syncToken() == _memory.token(tree)) return false; // it would never end
-    _memory.keepToken(tree, reader.syncToken(), applied->isAnother);
-    if (applied->isAnother) _memory.noteChanges(changes->size());
+    _memory.keepToken(tree, reader.syncToken(), applied->files);
+    if (!applied->files || !applied->files->empty()) _memory.noteChanges(changes->size());
     return true;
 }
 
@@ -149,37 +153,35 @@ std::optional<SyncedListing::Applied> SyncedListing::apply(const Url& tree,
         if (!isListed(below)) continue;
         const Url container = name->cxURLByDeletingLastComponent();
         Edits& inside = edits.try_emplace(container.absoluteString(), Edits{{}, container}).first->second;
-        inside.members[name->absoluteString()] = isGone ? std::nullopt : std::optional(change);
+        const std::string& whole = name->absoluteString();
+        inside.members[whole.substr(whole.rfind('/') + 1)] = isGone ? std::nullopt : std::optional(change);
     }
     for (const Url& name : departed)
         if (holdsListed(segmentsBelow(tree, name))) _memory.forgetBelow(name);
     for (const Url& name : collections)
         if (!_memory.has(name, ListingMemory::kSynced)) {
             _memory.keep(name, ListingMemory::kSynced, {});
-            out.isAnother = true;
+            out.files.reset();
         }
     for (auto& [place, edit] : edits) {
         // One that is not known has departed, or is told on a later page than what is in it.
-        const auto known = _memory.entries(edit.container, ListingMemory::kSynced);
         const auto isThere = [](const auto& member) { return member.second.has_value(); };
-        if (!known && std::none_of(edit.members.begin(), edit.members.end(), isThere)) continue;
-        ListingMemory::Entries fresh;
-        for (const auto& [name, entry] : known.value_or(ListingMemory::Entries())) {
-            const auto found = edit.members.find(name.absoluteString());
-            if (found == edit.members.end()) {
-                fresh.emplace_back(name, entry);
-                continue;
-            }
-            const bool isTheClock = edit.container == tree && name.cxLastComponent() == kClockFile;
-            if (!found->second || (!isTheClock && !isSameVersion(entry, *found->second))) out.isAnother = true;
-            if (found->second) fresh.emplace_back(name, *std::exchange(found->second, std::nullopt));
+        if (!_memory.has(edit.container, ListingMemory::kSynced)) {
+            if (std::none_of(edit.members.begin(), edit.members.end(), isThere)) continue;
+            _memory.keep(edit.container, ListingMemory::kSynced, {});
         }
-        for (const auto& [name, entry] : edit.members)
-            if (entry) {
-                fresh.emplace_back(*Url::parse(name), *entry);
-                out.isAnother = true;
-            }
-        _memory.keep(edit.container, ListingMemory::kSynced, fresh);
+        const bool isInBucket = isBucket(segmentsBelow(tree, edit.container));
+        _memory.edit(edit.container, ListingMemory::kSynced, edit.members,
+                     [&, &place = place, &edit = edit](const std::string& name, const auto& before, const auto& now) {
+                         if (!before && !now) return;
+                         if (before && now && isSameVersion(*before, *now)) return;
+                         if (before && now && edit.container == tree && name == kClockFile) return;
+                         const bool isFile = before && now && !before->isCollection && !now->isCollection;
+                         if (!isFile || !isInBucket)
+                             out.files.reset();
+                         else if (out.files)
+                             out.files->push_back(place + "/" + name);
+                     });
     }
     return _memory.has(tree, ListingMemory::kSynced) ? std::optional(out) : std::nullopt;
 }

@@ -27,8 +27,9 @@ public:
 private:
     bool take(const Url& tree, const HttpResponse& answer, bool& isCut);
     struct Applied {
-        bool isCut = false;     // another page follows
-        bool isAnother = false; // something has changed besides the date of the clock file
+        bool isCut = false; // another page follows
+        // Besides the clock file: contact files with another version, where all else is as it was.
+        ListingMemory::Files files = std::vector<std::string>();
     };
     std::optional<Applied> apply(const Url& tree, const std::vector<MultistatusEntry>& changes);
 

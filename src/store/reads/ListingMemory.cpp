@@ -5,6 +5,7 @@
 
 #include <algorithm>
 #include <cstring>
+#include <set>
 #include <utility>
 
 namespace rolvane {
@@ -24,15 +25,87 @@ ListingMemory::Container ListingMemory::packed(const Entries& entries) {
     out.rows.reserve(entries.size());
     for (const auto& [url, entry] : entries) {
         const std::string& whole = url.absoluteString();
-        const std::string_view name = std::string_view(whole).substr(whole.rfind('/') + 1);
-        const std::string& tag = entry.etag.str();
-        out.rows.push_back({static_cast<uint32_t>(out.text.size()), static_cast<uint32_t>(name.size()),
-                            static_cast<uint32_t>(tag.size()), entry.isCollection, entry.lastModified.has_value(),
-                            entry.length.has_value(), entry.lastModified ? entry.lastModified->secondsSince1970() : 0,
-                            entry.length.value_or(0)});
-        out.text.append(name).append(tag);
+        out.rows.push_back(rowOf(out.text, std::string_view(whole).substr(whole.rfind('/') + 1), entry));
     }
     return out;
+}
+
+ListingMemory::Row ListingMemory::rowOf(std::string& text, std::string_view encodedName,
+                                        const MultistatusEntry& entry) {
+    const std::string& tag = entry.etag.str();
+    const Row row{static_cast<uint32_t>(text.size()),
+                  static_cast<uint32_t>(encodedName.size()),
+                  static_cast<uint32_t>(tag.size()),
+                  entry.isCollection,
+                  entry.lastModified.has_value(),
+                  entry.length.has_value(),
+                  entry.lastModified ? entry.lastModified->secondsSince1970() : 0,
+                  entry.length.value_or(0)};
+    text.append(encodedName).append(tag);
+    return row;
+}
+
+std::string_view ListingMemory::nameOf(const Container& container, const Row& row) {
+    return std::string_view(container.text).substr(row.at, row.nameLength);
+}
+
+void ListingMemory::compact(Container& container) {
+    std::string text;
+    text.reserve(container.text.size() - container.unused);
+    for (Row& row : container.rows) {
+        const size_t at = text.size();
+        text.append(container.text, row.at, row.nameLength + row.tagLength);
+        row.at = static_cast<uint32_t>(at);
+    }
+    container.text = std::move(text);
+    container.unused = 0;
+}
+
+bool ListingMemory::edit(const Url& container, const std::string& tag, const Edits& edits, const Told& told) {
+    const Lock guard(_mutex);
+    const auto found = _containers.find(container.absoluteString());
+    if (tag.empty() || found == _containers.end() || found->second.tag != tag) return false;
+    Container& kept = found->second;
+    _bytes -= kept.bytes();
+    std::set<std::string_view> known; // of `edits`
+    size_t rows = 0;
+    for (Row& row : kept.rows) {
+        const auto edit = edits.find(nameOf(kept, row));
+        if (edit != edits.end()) {
+            const auto& [name, now] = *edit;
+            known.insert(name);
+            told(name, unpacked(kept, row).entry, now);
+            kept.unused += row.nameLength + row.tagLength;
+            if (!now) continue;
+            row = rowOf(kept.text, name, *now);
+        }
+        kept.rows[rows++] = row;
+    }
+    kept.rows.resize(rows);
+    for (const auto& [name, now] : edits) {
+        if (known.contains(name)) continue;
+        told(name, std::nullopt, now);
+        if (now) kept.rows.push_back(rowOf(kept.text, name, *now));
+    }
+    if (kept.unused > kept.text.size() / 2) compact(kept);
+    _bytes += kept.bytes();
+    if (_bytes > kMostBytes) {
+        _containers.clear();
+        _tokens.clear();
+        _bytes = 0;
+    }
+    return true;
+}
+
+std::optional<MultistatusEntry> ListingMemory::member(const Url& container, const std::string& tag,
+                                                      std::string_view encodedName) const {
+    const Lock guard(_mutex);
+    const auto found = _containers.find(container.absoluteString());
+    if (tag.empty() || found == _containers.end() || found->second.tag != tag) return std::nullopt;
+    const Container& kept = found->second;
+    const auto row = std::find_if(kept.rows.begin(), kept.rows.end(),
+                                  [&](const Row& each) { return nameOf(kept, each) == encodedName; });
+    return row == kept.rows.end() ? std::nullopt : std::optional(unpacked(kept, *row).entry);
 }
 
 ListingMemory::Member ListingMemory::unpacked(const Container& container, const Row& row) {
@@ -96,14 +169,31 @@ void ListingMemory::takeOver(const Url& tree, ListingMemory&& from) {
     keepToken(tree, token);
 }
 
-void ListingMemory::keepToken(const Url& tree, const std::string& token, bool isAnother) {
+void ListingMemory::keepToken(const Url& tree, const std::string& token, const Files& files) {
     const Lock guard(_mutex);
     const auto [found, isNew] = _tokens.try_emplace(tree.absoluteString());
     Synced& synced = found->second;
     _isNew = _isNew || isNew;
     synced.token = token;
     synced.isUsed = true;
-    if (isAnother || synced.state == 0) synced.state = ++_lastState;
+    if (files && files->empty() && synced.state != 0) return;
+    synced.state = ++_lastState;
+    if (files && !isNew && synced.files.size() + files->size() <= kMostFiles) {
+        for (const std::string& file : *files) synced.files.emplace_back(synced.state, file);
+        return;
+    }
+    synced.files.clear();
+    synced.filesFrom = synced.state;
+}
+
+ListingMemory::Files ListingMemory::filesChangedSince(const Url& tree, uint64_t state) const {
+    const Lock guard(_mutex);
+    const auto found = _tokens.find(tree.absoluteString());
+    if (found == _tokens.end() || state < found->second.filesFrom || state > found->second.state) return std::nullopt;
+    std::vector<std::string> files;
+    for (const auto& [when, file] : found->second.files)
+        if (when > state) files.push_back(file);
+    return files;
 }
 
 uint64_t ListingMemory::stateOf(const Url& tree) const {
@@ -179,6 +269,7 @@ bool ListingMemory::restore(std::string_view text) {
             fresh.tag = kSynced;
             fresh.text = in.text();
             CacheReader rows(in.bytes(std::min<uint64_t>(in.number(), text.size() / kRowBytes + 1) * kRowBytes));
+            size_t used = 0;
             while (!rows.atEnd()) {
                 const uint64_t where = rows.number(), what = rows.number(), modified = rows.number();
                 Row row{static_cast<uint32_t>(where >> 32),
@@ -192,7 +283,9 @@ bool ListingMemory::restore(std::string_view text) {
                 std::memcpy(&row.modified, &modified, sizeof modified);
                 if (uint64_t{row.at} + row.nameLength + row.tagLength > fresh.text.size()) return false;
                 fresh.rows.push_back(row);
+                used += row.nameLength + row.tagLength;
             }
+            fresh.unused = fresh.text.size() - std::min(used, fresh.text.size());
             bytes += fresh.bytes();
             containers.insert_or_assign(url, std::move(fresh));
         }
@@ -200,7 +293,7 @@ bool ListingMemory::restore(std::string_view text) {
     }
     const Lock guard(_mutex);
     if (!_containers.empty() || !_tokens.empty() || bytes > kMostBytes) return false;
-    for (auto& [tree, synced] : tokens) synced.state = ++_lastState;
+    for (auto& [tree, synced] : tokens) synced.state = synced.filesFrom = ++_lastState;
     _containers = std::move(containers);
     _tokens = std::move(tokens);
     _bytes = bytes;

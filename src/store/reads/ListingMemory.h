@@ -6,6 +6,8 @@
 #include "foundation/Url.h"
 
 #include <cstdint>
+#include <functional>
+#include <map>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -34,10 +36,15 @@ public:
     // Up to where the containers of a tree are known (RFC 6578): those that are kept with the tag kSynced are as the
     // token says. Goes with anything of the memory.
     static constexpr const char* kSynced = "synced";
-    // `isAnother`: something in the tree is not as it was when the token before it was kept.
-    void keepToken(const Url& tree, const std::string& token, bool isAnother = true);
+    // `files`: the URLs of files that have another version than when the token before it was kept, where nothing else
+    // is different; nothing: anything may be.
+    using Files = std::optional<std::vector<std::string>>;
+    void keepToken(const Url& tree, const std::string& token, const Files& files = std::nullopt);
     std::string token(const Url& tree) const; // "" when there is none
     uint64_t stateOf(const Url& tree) const;  // another number for another state, in this process; 0 without a token
+    // The files that may have another version than in that state of the tree; nothing: something else may be different,
+    // too, or they are too many.
+    Files filesChangedSince(const Url& tree, uint64_t state) const;
 
     // For a file (CacheFile.h). A token and the containers below its tree stay true together, however old they are. So
     // they are worth saving when a tree has come, when a tenth of all members has changed, and when the process ends.
@@ -51,6 +58,14 @@ public:
     // Takes over what `saved` gave. False where the text is damaged; nothing is taken over then.
     bool restore(std::string_view text);
     bool has(const Url& container, const std::string& tag) const;
+    // Members of a container that is kept, by their names as they are written in URLs: an entry that is to be there, or
+    // nothing for one that is gone. Each is told with the entry before. False, and nothing told, without the container.
+    using Edits = std::map<std::string, std::optional<MultistatusEntry>, std::less<>>;
+    using Told = std::function<void(const std::string& encodedName, const std::optional<MultistatusEntry>& before,
+                                    const std::optional<MultistatusEntry>& now)>;
+    bool edit(const Url& container, const std::string& tag, const Edits& edits, const Told& told);
+    std::optional<MultistatusEntry> member(const Url& container, const std::string& tag,
+                                           std::string_view encodedName) const;
     // The members, named below the container; nothing when it is not kept with this tag.
     std::optional<Entries> entries(const Url& container, const std::string& tag) const;
 
@@ -79,10 +94,14 @@ private:
     struct Container {
         std::string tag, text;
         std::vector<Row> rows;
+        size_t unused = 0; // bytes of the text that no row needs
         size_t bytes() const { return text.size() + rows.size() * sizeof(Row); }
     };
     static Member unpacked(const Container& container, const Row& row);
+    static std::string_view nameOf(const Container& container, const Row& row);
+    static Row rowOf(std::string& text, std::string_view encodedName, const MultistatusEntry& entry);
     static Container packed(const Entries& entries);
+    static void compact(Container& container);
     size_t members() const REQUIRES(_mutex);
 
     mutable Mutex _mutex;
@@ -90,8 +109,11 @@ private:
     struct Synced {
         std::string token;
         uint64_t state = 0;
-        bool isUsed = false; // the store has given the token in this process
+        bool isUsed = false;                                 // the store has given the token in this process
+        std::vector<std::pair<uint64_t, std::string>> files; // of the states behind `filesFrom`, by state
+        uint64_t filesFrom = 0;
     };
+    static constexpr size_t kMostFiles = 256;
     std::unordered_map<std::string, Synced> _tokens GUARDED_BY(_mutex); // by tree
     uint64_t _lastState GUARDED_BY(_mutex) = 0;
     size_t _bytes GUARDED_BY(_mutex) = 0;

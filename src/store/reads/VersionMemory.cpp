@@ -154,7 +154,7 @@ void VersionMemory::judge(const Owner& owner) {
         _unsaved.clear();
         _fileNumber = 0;
         _isForeign = true;
-        ++_changes;
+        noteChangeOfMany();
     }
     _owner = owner;
 }
@@ -171,7 +171,7 @@ void VersionMemory::revert() {
     Lock guard(_mutex);
     _isRead = false;
     _judge.reset();
-    ++_changes;
+    noteChangeOfMany();
 }
 
 void VersionMemory::save(const Owner& owner) {
@@ -261,19 +261,29 @@ void VersionMemory::put(std::string_view url, Entry entry) {
     if (_entries.size() >= _capacity && !_entries.contains(key)) {
         _unsaved.insert(_entries.begin()->first);
         _entries.erase(_entries.begin());
+        noteChangeOfMany(); // a URL that nobody can tell any more
     }
     const auto [held, isNew] = _entries.try_emplace(key, entry);
     if (!isNew && held->second == entry) return;
     held->second = entry;
     _unsaved.insert(key);
-    if (!url.ends_with(kClockFile)) ++_changes;
+    if (!url.ends_with(kClockFile)) noteChange(url);
+}
+
+void VersionMemory::noteChange(std::string_view url) {
+    if (_named.empty()) _named.resize(kNamed);
+    _named[++_changes % kNamed] = url;
+}
+
+void VersionMemory::noteChangeOfMany() {
+    _namedFrom = ++_changes;
 }
 
 void VersionMemory::erase(std::string_view url) {
     const uint64_t key = hash(url);
     if (_entries.erase(key) == 0) return;
     _unsaved.insert(key);
-    ++_changes;
+    noteChange(url);
 }
 
 void VersionMemory::read(std::string_view url, const FileVersion& v) {
@@ -347,6 +357,14 @@ uint64_t VersionMemory::markOf(std::string_view url) {
 uint64_t VersionMemory::changes() {
     Lock guard(_mutex);
     return _changes;
+}
+
+std::optional<std::vector<std::string>> VersionMemory::changedSince(uint64_t changes) {
+    const Lock guard(_mutex);
+    if (changes < _namedFrom || changes > _changes || _changes - changes > kNamed) return std::nullopt;
+    std::vector<std::string> urls;
+    for (uint64_t number = changes + 1; number <= _changes; ++number) urls.push_back(_named[number % kNamed]);
+    return urls;
 }
 
 size_t VersionMemory::count() {

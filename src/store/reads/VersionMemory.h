@@ -10,6 +10,7 @@
 #include <string_view>
 #include <unordered_map>
 #include <unordered_set>
+#include <vector>
 
 namespace rolvane {
 
@@ -59,6 +60,8 @@ public:
     size_t count();
     // So often something has become known or was forgotten in this process, clock files left out.
     uint64_t changes();
+    // The URLs of that since the count was so; nothing where they are many, or anything else may have changed.
+    std::optional<std::vector<std::string>> changedSince(uint64_t changes);
 
 private:
     enum class Kind : uint64_t { tag = 1, dated = 2, written = 3 };
@@ -91,7 +94,13 @@ private:
     std::optional<Owner> _judge GUARDED_BY(_mutex); // whose it has to be, before it is read
     std::unordered_map<uint64_t, Entry> _entries GUARDED_BY(_mutex);
     std::unordered_set<uint64_t> _unsaved GUARDED_BY(_mutex); // hashes of URLs
+    void noteChange(std::string_view url) REQUIRES(_mutex);
+    void noteChangeOfMany() REQUIRES(_mutex);
+
+    static constexpr size_t kNamed = 256;
     uint64_t _changes GUARDED_BY(_mutex) = 0;
+    std::vector<std::string> _named GUARDED_BY(_mutex); // URLs of the last changes, each at its number modulo kNamed
+    uint64_t _namedFrom GUARDED_BY(_mutex) = 0;         // the changes up to this number have no names
     uint64_t _fileNumber GUARDED_BY(_mutex) = 0, _fileSize GUARDED_BY(_mutex) =
                                                      0; // of the file as it was read or written last; 0: of none
 };
