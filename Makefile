@@ -78,16 +78,7 @@ bench:
 	@packaging/setup build test bench
 	cmake --preset bench
 	cmake --build --preset bench -j$(JOBS)
-	bench/run build/bench
-	bench/longlist.py build/bench
-	bench/signin.py build/bench
-	bench/naming.py build/bench
-	bench/subscribers.py build/bench
-	bench/books.py build/bench
-	bench/bookput.py build/bench
-	BENCH_DOCS=docs/performance.md bench/onechange.py build/bench
-	BENCH_DOCS=docs/performance.md bench/news.py build/bench
-	BENCH_DOCS=docs/capacity.md bench/load.py build/bench
+	bench/all build/bench
 
 lint:
 	@packaging/setup build test lint

@@ -165,7 +165,8 @@ class Publisher(Person):
         self.run("account", "set", "--user", name, "--endpoint",
                  store.endpoint.replace(f":{store.port}/", f":{port}/") if port else store.endpoint,
                  "--ca-file", store.authority, "--ask-password", stdin=PASSWORD + "\n")
-        self.run("defaults", "write", "CXDThreadCountKey", str(workers), "--type", "int")
+        if workers:  # else as many as the daemon thinks best
+            self.run("defaults", "write", "CXDThreadCountKey", str(workers), "--type", "int")
         cards = os.path.join(self.home, "cards.vcf")
         write_cards(cards, count)
         before = children_cpu()

@@ -16,7 +16,7 @@ from clients import hidden_password
 
 CONTACT = re.compile(r"/People/\d+/.")
 CONNECTIONS, STREAMS = 10, 100  # over HTTP/1.1, and on the one connection over HTTP/2
-NEAR_AIM, FAR_AIM, NOTHING_AIM = 0.5, 0.9, 3.0
+NEAR_AIM, FAR_AIM, NOTHING_AIM = 0.65, 0.9, 3.0
 MEMORY_LIMIT, MEMORY_PEOPLE = 300, 50000
 RCLONE_FILES, PEER_FILES = 200, 10000  # so many tell a client's rate, however many more the tree holds
 ROUNDS = {1000: 3}  # on loopback; otherwise 1. Everybody's fastest counts.

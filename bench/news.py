@@ -16,7 +16,7 @@ import statistics
 import sys
 import time
 
-from benchworld import PASSWORD, Failure, Person, Publisher, Store, World, put_table
+from benchworld import PASSWORD, Failure, Person, Publisher, Store, World, put_table, save_json
 
 PEOPLE, MOST_SECONDS, MOST_MEGABYTES = 100, 1.0, 100
 OF_ONE_USER = 16  # requests that the store lets one user have
@@ -168,6 +168,9 @@ def main(build, count=40, held=1000):
               f"{middle:.0f} ms, the last within {last:.0f} ms")
         for connection in connections:
             connection.close()
+        save_json(os.path.join(build, "news.json"),
+                  {"delays": ended, "since_begun": begun, "requests": requests / count, "waiting": held, "megabytes": memory,
+                   "idle": idle, "lines": [first, middle, last]})
         put_table("news", [
             "| what | seen | aim |", "|---|---|---|",
             f"| an edit in the other person's database, from the end of `rolvane edit`: median of {count} | "
