@@ -17,9 +17,9 @@
 
 namespace rolvane::worlds {
 
-// One of the three people, as far as processes need to know.
+// One of the three people, or a computer of one, as far as processes need to know.
 struct Person {
-    char role = 'o';       // 'o' the owner, 'w' the writer, 'r' the reader
+    char role = 'o';       // 'o' the owner, 's' the owner's second computer, 'w' the writer, 'r' the reader
     std::string directory; // database, preferences, state
     CXDAVAccount account;
     std::string password;
@@ -27,7 +27,8 @@ struct Person {
     int threads = 3;
 
     std::string database() const { return directory + "/contacts.db"; }
-    RemoteLocation location() const { return RemoteLocation(role == 'o' ? "" : tree.absoluteString()); }
+    bool isOwner() const { return role == 'o' || role == 's'; }
+    RemoteLocation location() const { return RemoteLocation(isOwner() ? "" : tree.absoluteString()); }
 };
 
 // The person's daemon in this process: what the program puts together, over the same files. Once a process.

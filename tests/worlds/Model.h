@@ -11,7 +11,7 @@ namespace rolvane::worlds {
 struct Deed {
     enum class Kind { makePerson, makeGroup, remove, set };
     Kind kind;
-    char who; // 'o' the owner, 'w' the writer
+    char who; // 'o' the owner, 'w' the writer; a computer of the owner's counts as somebody, see World::putBack
     std::string thing;
     std::string cell;          // of `set`: the part that was changed, see below
     std::string before, after; // what the person saw there, and what stands there now; "" for nothing

@@ -16,7 +16,12 @@ std::string oneLine(std::string text) {
 
 } // namespace
 
-void Report::send(const std::string& bytes) {
+void Report::send(const std::string& lines) {
+    std::string bytes;
+    for (size_t from = 0, end = 0; from < lines.size(); from = end) {
+        end = lines.find('\n', from) + 1;
+        bytes += _whose + lines.substr(from, end - from);
+    }
     const std::lock_guard guard(_mutex);
     for (size_t sent = 0; sent < bytes.size();) {
         const ssize_t n = ::write(_descriptor, bytes.data() + sent, bytes.size() - sent);

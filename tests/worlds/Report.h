@@ -8,11 +8,13 @@
 
 namespace rolvane::worlds {
 
-// What a process of a world tells the one that started it: lines on a pipe, a letter and fields with tabs between.
-// A line is written whole or not at all, and stays when the process is killed. Any thread.
+// What a process of a world tells the one that started it: lines on a pipe, a letter and fields with tabs between. A
+// line is written whole or not at all, and stays when the process is killed. Two processes may share the pipe; but for
+// views, lines come in the order in which they were written. Any thread.
 class Report {
 public:
-    explicit Report(int descriptor) : _descriptor(descriptor) {}
+    // `whose`: begins each line.
+    explicit Report(int descriptor, std::string whose = {}) : _descriptor(descriptor), _whose(std::move(whose)) {}
 
     void line(char kind, std::string_view text = {});
     void deed(const Deed& deed);
@@ -24,8 +26,9 @@ public:
     void die(std::string_view where);
 
 private:
-    void send(const std::string& bytes);
+    void send(const std::string& lines);
     const int _descriptor;
+    const std::string _whose;
     std::mutex _mutex;
     std::recursive_mutex _whole;
 };
@@ -43,7 +46,7 @@ inline constexpr char kWrong = 'E';    // something that must not be
 inline constexpr char kPerson = 'p', kGroup = 'g', kCell = 'c', kWhole = 'w';
 } // namespace lines
 
-// The line's fields; taken back into the model's forms.
+// The fields of a line without its first letter; taken back into the model's forms.
 std::vector<std::string> fieldsOf(std::string_view line);
 Deed deedOf(const std::vector<std::string>& fields);
 void readViewLine(char kind, const std::vector<std::string>& fields, View& into);

@@ -1,6 +1,7 @@
 #include "World.h"
 
 #include "StoreView.h"
+#include "conduits/store/ComputersOnStore.h"
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
 
@@ -47,11 +48,12 @@ World::World(PrivateStore& store, uint64_t seed, Options options)
     const char* temporary = std::getenv("TMPDIR");
     _directory = std::string(temporary ? temporary : "/tmp") + "/world-" + suffix;
     fs::create_directories(_directory);
-    for (const char role : {'o', 'w', 'r'}) {
+    for (const char role : {'o', 'w', 'r', 's'}) {
+        if (role == 's' && !_options.second) continue;
         Person made;
         made.role = role;
         made.password = kPassword;
-        made.account.user = UserName(role + suffix);
+        made.account.user = UserName((made.isOwner() ? 'o' : role) + suffix);
         made.account.endpoint = _store.endpointTemplate();
         made.account.nameHost = "contacts.example.org";
         made.account.caFile = _store.caFile();
@@ -59,9 +61,10 @@ World::World(PrivateStore& store, uint64_t seed, Options options)
         made.tree = made.account.baseLocationFor(UserName("o" + suffix));
         made.threads = static_cast<int>(_chance.between(1, 4));
         fs::create_directories(made.directory + "/state");
-        _store.addUser(made.account.user.str(), kPassword);
+        if (role != 's') _store.addUser(made.account.user.str(), kPassword);
         _people.push_back(made);
     }
+    if (_options.second) makeSecondComputer();
     _log = ::open((_directory + "/story").c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0600);
 }
 
@@ -77,10 +80,21 @@ World::~World() {
                  none);
     }
     fs::remove_all(_directory, none);
-    for (const Person& each : _people) {
-        _store.removeUser(each.account.user.str());
-        fs::remove_all(_store.userDirectory(each.account.user.str()), none);
+    std::set<std::string> users;
+    for (const Person& each : _people) users.insert(each.account.user.str());
+    for (const auto& [role, mayRead] : _mayRead) users.insert(readerOf(role));
+    for (const std::string& user : users) {
+        _store.removeUser(user);
+        fs::remove_all(_store.userDirectory(user), none);
     }
+}
+
+Person& World::person(char role) {
+    return *std::find_if(_people.begin(), _people.end(), [&](const Person& each) { return each.role == role; });
+}
+
+std::vector<char> World::roles() const {
+    return _hasJoined ? std::vector<char>{'o', 's', 'w', 'r'} : std::vector<char>{'o', 'w', 'r'};
 }
 
 World::Climate World::climateOf(Chance& chance) const {
@@ -127,6 +141,7 @@ World::Climate World::climateOf(Chance& chance) const {
     if (!with("disks")) made.fullDisks = 0;
     if (!with("overlap")) made.overlaps = 0;
     if (!with("refusals")) made.refusals = false;
+    if (_options.second) made.steps = chance.between(24, 44);
     if (_options.steps > 0) made.steps = static_cast<size_t>(_options.steps);
     return made;
 }
@@ -139,17 +154,24 @@ void World::tell(const std::string& text) {
 // Processes ----------------------------------------------------------------------------------------------------------
 
 void World::inProcess(const std::string& what, char who, const Work& work, View* view) {
-    tell("== " + what + " of " + who + ", process " + std::to_string(++_processes));
+    inProcesses(what, {{who, work}}, view);
+}
+
+void World::inProcesses(const std::string& what, const std::vector<Job>& jobs, View* view) {
     int ends[2];
     if (::pipe2(ends, O_CLOEXEC) != 0) throw CXException("CXWorldException", "no pipe");
-    const pid_t child = ::fork();
-    if (child == 0) {
+    std::map<pid_t, char> children;
+    for (const auto& [who, work] : jobs) {
+        tell("== " + what + " of " + who + ", process " + std::to_string(++_processes));
+        const pid_t child = ::fork();
+        children[child] = who;
+        if (child != 0) continue;
         ::close(ends[0]);
         for (const char* name : {"XDG_STATE_HOME", "XDG_DATA_HOME", "XDG_CACHE_HOME", "XDG_CONFIG_HOME"})
             ::setenv(name, (person(who).directory + "/state").c_str(), 1);
         LogSink::install(std::make_shared<FileLog>(_log));
         setDebugLevel(1);
-        Report report(ends[1]);
+        Report report(ends[1], std::string(1, who));
         try {
             work(report);
         } catch (const CXException& exception) {
@@ -164,20 +186,24 @@ void World::inProcess(const std::string& what, char who, const Work& work, View*
         pollfd ready{ends[0], POLLIN, 0};
         if (!late && ::poll(&ready, 1, kPatience * 1000) == 0) {
             late = true;
-            _wrong.push_back(what + " of " + who + " does not end");
-            ::kill(child, SIGKILL);
+            for (const auto& [child, who] : children) {
+                _wrong.push_back(what + " of " + who + " does not end");
+                ::kill(child, SIGKILL);
+            }
         }
         const ssize_t n = ::read(ends[0], bytes, sizeof bytes);
         if (n <= 0) break;
         waiting.append(bytes, static_cast<size_t>(n));
         for (size_t end = 0; (end = waiting.find('\n')) != std::string::npos; waiting.erase(0, end + 1))
-            take(who, waiting.substr(0, end), view);
+            take(waiting[0], waiting.substr(1, end - 1), view);
     }
     ::close(ends[0]);
-    int status = 0;
-    ::waitpid(child, &status, 0);
-    if (WIFSIGNALED(status) && WTERMSIG(status) != SIGKILL)
-        _wrong.push_back(what + " of " + who + " ended by signal " + std::to_string(WTERMSIG(status)));
+    for (const auto& [child, who] : children) {
+        int status = 0;
+        ::waitpid(child, &status, 0);
+        if (WIFSIGNALED(status) && WTERMSIG(status) != SIGKILL)
+            _wrong.push_back(what + " of " + who + " ended by signal " + std::to_string(WTERMSIG(status)));
+    }
     copyAll("end");
 }
 
@@ -198,19 +224,27 @@ void World::take(char who, const std::string& line, View* view) {
     const std::vector<std::string> fields = fieldsOf(line);
     if (kind != lines::kPerson && kind != lines::kGroup && kind != lines::kCell && kind != lines::kWhole)
         tell("   " + line);
+    const auto former = _selves.find(who);
+    const char self = former == _selves.end() ? who : former->second;
     switch (kind) {
-    case lines::kDeed:
-        _model.take(deedOf(fields));
+    case lines::kDeed: {
+        Deed deed = deedOf(fields);
+        deed.who = self;
+        _model.take(deed);
         ++_outcome.edits;
         break;
+    }
     case lines::kKilled: ++_outcome.kills; break;
     case lines::kFault: ++(fields.at(0).starts_with("away") ? _outcome.away : _outcome.faults); break;
     case lines::kRefused:
         ++_outcome.refusals;
-        _model.refused(who);
+        _model.refused(self);
         break;
     case lines::kDiskFull: ++_outcome.diskFailures; break;
-    case lines::kSettled: _model.settled(who); break;
+    case lines::kSettled:
+        _model.settled(self);
+        _settled.insert(who);
+        break;
     case lines::kWrote: _wrote.push_back(std::string(1, who) + " " + fields.at(0)); break;
     case lines::kThrew: ++_outcome.exceptions; break;
     case lines::kWrong: _wrong.push_back(std::string(1, who) + ": " + fields.at(0)); break;
@@ -247,6 +281,7 @@ void World::begin() {
         database.save();
         Editor('o', database, {}, hashOf("first", _seed), "0", report).makeAtFirst(_climate.people, _climate.groups);
     });
+    if (_options.second) beginSecondComputer();
     clean('o');
     for (const char role : {'w', 'r'})
         inProcess("subscribing", role, [&, role](Report&) {
@@ -307,18 +342,28 @@ void World::live(char role, const std::string& stamp, const Weather& weather, ui
 
 void World::step(size_t number) {
     const std::string stamp = std::to_string(number);
+    if (_options.second && (number == _joinsAt ? (join(), true) : hasStepOfItsOwn(stamp))) return;
     const uint64_t seed = _chance.next();
-    const char role = "owwooowrr"[_chance.below(9)];
+    const std::string turns = _hasJoined ? "oosswwossrosr" : "owwooowrr";
+    const char role = turns[_chance.below(turns.size())];
     const bool edits = role != 'r' && (role != 'w' || with("writer")) && _chance.happens(0.4);
     const Weather today = weather();
     if (edits) {
         inProcess("edits", role, [&](Report& report) { edit(role, stamp, seed, report); });
         return;
     }
-    ++_outcome.passes;
-    Weather here = today;
-    here.ownTree = "/dav/" + person(role).account.user.str() + "/";
-    inProcess("daemon", role, [&](Report& report) { live(role, stamp, here, seed, report); });
+    serve({{role, seed, today}}, stamp);
+}
+
+// Daemons, at the same time where there are several.
+void World::serve(std::vector<Service> services, const std::string& stamp) {
+    std::vector<Job> jobs;
+    for (Service& each : services) {
+        ++_outcome.passes;
+        each.weather.ownTree = "/dav/" + person(each.role).account.user.str() + "/";
+        jobs.push_back({each.role, [&](Report& report) { live(each.role, stamp, each.weather, each.seed, report); }});
+    }
+    inProcesses("daemon", jobs);
 }
 
 void World::clean(char role) {
@@ -344,9 +389,9 @@ View World::viewOf(char role) {
         [&](Report& report) {
             CXRolvane database(CXRolvane::Options{.path = person(role).database(), .program = "rolvane"});
             View seen = Editor::view(database, person(role).location());
-            if (role != 'o' && database.countPeople(RemoteLocation("")) > 0)
+            if (!person(role).isOwner() && database.countPeople(RemoteLocation("")) > 0)
                 seen.faults.push_back("somebody else's contact became the person's own");
-            if (role != 'o' && !database.findSubscriptionWithRemoteLocation(person(role).location()))
+            if (!person(role).isOwner() && !database.findSubscriptionWithRemoteLocation(person(role).location()))
                 seen.faults.push_back("the subscription is gone");
             report.view(seen);
         },
@@ -360,7 +405,9 @@ std::vector<std::string> World::compareAll() {
         for (const std::string& each : found) all.push_back(where + ": " + each);
     };
     const View owner = viewOf('o'),
-               store = viewOfStore(_store.userDirectory(person('o').account.user.str()) + "/Contacts");
+               store =
+                   viewOfStore(_store.userDirectory(person('o').account.user.str()) + "/Contacts",
+                               _hasJoined ? std::set<std::string>{ComputersOnStore::kFile} : std::set<std::string>{});
     add("owner", _model.differences(owner));
     add("store", _model.differences(store));
     const auto compare = [&](const auto& ours, const auto& theirs, const std::string& whose) {
@@ -377,12 +424,14 @@ std::vector<std::string> World::compareAll() {
     };
     compare(owner.people, store.people, "store");
     compare(owner.groups, store.groups, "store");
-    for (const char role : {'w', 'r'}) {
+    for (const char role : roles()) {
+        if (role == 'o') continue;
         const View copy = viewOf(role);
-        const std::string whose = role == 'w' ? "writer" : "reader";
+        const std::string whose = role == 'w' ? "writer" : role == 'r' ? "reader" : "second computer";
         add(whose, _model.differences(copy));
         compare(owner.whole, copy.whole, whose);
     }
+    if (_hasJoined) add("rights", wrongRights());
     return all;
 }
 
@@ -392,7 +441,7 @@ void World::settle() {
     _settling = true;
     tell("== all is well again");
     for (size_t round = 1; round <= kRounds; ++round) {
-        for (const char role : {'o', 'w', 'r'}) clean(role);
+        for (const char role : roles()) clean(role);
         _outcome.cleanPasses = round;
         if (round == 1) continue;
         _outcome.differences = compareAll();
@@ -400,8 +449,10 @@ void World::settle() {
     }
     // Once more: there is nothing left to do.
     _wrote.clear();
-    for (const char role : {'o', 'w', 'r'}) clean(role);
-    for (const std::string& write : _wrote) _outcome.differences.push_back("not at rest: " + write);
+    for (const char role : roles()) clean(role);
+    for (const std::string& write : _wrote)
+        if (!write.ends_with(ComputersOnStore::kFile)) // a computer tells once an hour that it is there
+            _outcome.differences.push_back("not at rest: " + write);
     for (const std::string& wrong : _wrong) _outcome.differences.push_back(wrong);
     for (const Person& each : _people) {
         std::error_code none;

@@ -20,8 +20,8 @@
 namespace rolvane::worlds {
 namespace {
 
-constexpr const char* kUsage = R"(usage: worlds [--seeds LIST] [--jobs N] [--without WHAT,...] [--steps N]
-              [--keep DIRECTORY] [--keep-all] [--copies]
+constexpr const char* kUsage = R"(usage: worlds [--seeds LIST] [--jobs N] [--second] [--without WHAT,...]
+              [--steps N] [--keep DIRECTORY] [--keep-all] [--copies]
 
 Each seed is a world: an owner, a writer and a reader, who edit while requests fail, daemons are killed, the store is
 away and disks are full. In the end everybody's copy, the store and a plain model must be equal. A line a world, then a
@@ -29,9 +29,12 @@ table; exit status 1 when anything differs.
 
   --seeds    which worlds: numbers and ranges, as 1..20,33 (1..20)
   --jobs     how many at a time (1)
+  --second   the owner has a second computer, which joins in one of the first steps: other worlds than without it
   --without  leaves out: kills, faults, outages, disks, refusals, nesting, writer, overlap,
              last: the last contact is never deleted, single kinds of faults: 500, 503, 412, 423, 403, 404, reset,
-             time-out, portal, "lost answer", "cut answer", and locks: those at LOCK and UNLOCK, and merging: where both have edited one contact either version may stand
+             time-out, portal, "lost answer", "cut answer", and locks: those at LOCK and UNLOCK, and merging: where
+             both have edited one contact either version may stand; of second computers: sides (both daemons at
+             once), backups (older states put back), rights (changed on both)
   --steps    how many steps a world has, instead of as its seed says
   --keep     where the files and the story of each world that differs are put; with --keep-all, of every one
   --copies   everybody's database and the tree as each pass leaves them are kept there, too
@@ -40,7 +43,8 @@ table; exit status 1 when anything differs.
 struct Totals {
     std::atomic<uint64_t> next = 0;
     std::atomic<size_t> worlds = 0, differing = 0, edits = 0, conflicts = 0, passes = 0, kills = 0, faults = 0,
-                        away = 0, diskFailures = 0, refusals = 0, exceptions = 0, threeRounds = 0, milliseconds = 0;
+                        away = 0, diskFailures = 0, refusals = 0, exceptions = 0, threeRounds = 0, restored = 0,
+                        sideBySide = 0, milliseconds = 0;
 };
 
 struct Arguments {
@@ -88,6 +92,10 @@ Arguments argumentsOf(int argc, char** argv) {
         }
         if (name == "--copies") {
             a.options.copies = true;
+            continue;
+        }
+        if (name == "--second") {
+            a.options.second = true;
             continue;
         }
         if (i + 1 == argc) misuse(name + " needs a value");
@@ -138,6 +146,8 @@ void add(Totals& totals, const Outcome& o) {
     totals.diskFailures += o.diskFailures;
     totals.refusals += o.refusals;
     totals.exceptions += o.exceptions;
+    totals.restored += o.restored;
+    totals.sideBySide += o.sideBySide;
     totals.threeRounds += o.cleanPasses > 2 ? 1 : 0;
     totals.milliseconds += static_cast<size_t>(o.seconds * 1000);
 }
@@ -187,6 +197,9 @@ int run(const Arguments& arguments) {
                 t.edits.load(), t.conflicts.load(), t.passes.load(), t.kills.load(), t.faults.load(), t.away.load(),
                 t.diskFailures.load(), t.refusals.load(), t.exceptions.load(), t.threeRounds.load(),
                 t.worlds == 0 ? 0.0 : static_cast<double>(t.milliseconds) / 1000 / static_cast<double>(t.worlds));
+    if (arguments.options.second)
+        std::printf("steps with both daemons at once %zu; former states put back %zu\n", t.sideBySide.load(),
+                    t.restored.load());
     failed |= t.worlds != arguments.seeds.size();
     return failed || t.differing > 0 ? 1 : 0;
 }
