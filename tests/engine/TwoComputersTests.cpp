@@ -153,9 +153,12 @@ TEST_F(TwoComputers, MembersOfAGroupOfBothGoOutHoweverOldTheyAre) {
     laptop.application->addRecord(copy);
     copy->addMember(ben);
     laptop.application->save();
+    join(laptop);
+    laptop.pass();
+    // As where it was in step before, and made passes for others' contacts since it left.
     laptop.preferences.set(kDaemonDomain, kCXDCXConduitLastSyncDate, laptop.clock.now().addingSeconds(3600));
     laptop.preferences.synchronize(kDaemonDomain);
-    joinAndSettle();
+    settle(5);
     expectEqual();
     EXPECT_EQ(at(desk, friends)->memberCount(), 3u) << log.text();
 }
@@ -189,6 +192,7 @@ TEST_F(TwoComputers, AnEditWhileNothingCanBeTakenInHoldsNothingUp) {
     expectNewsFromHereOn(laptop);
     name(laptop, people[0], "Ada of the laptop");
     laptop.database->deliverExternalChanges();
+    EXPECT_TRUE(laptop.engine->getPendingChanges().empty()) << "nothing captured now goes out before all is taken in";
     settle(6);
     expectEqual();
 }
@@ -231,6 +235,29 @@ TEST_F(TwoComputers, ATreeWithoutItsListIsNotTakenInAndGetsNone) {
     settle(6); // the first one mends its tree
     expectEqual();
     EXPECT_EQ(desk.countPeople(), 4u) << log.text();
+}
+
+// It has never read its own tree by then, and knows it by what it has written.
+TEST_F(TwoComputers, WhatTheFirstOneDeletesAndRenamesBeforeItFindsOutStands) {
+    std::filesystem::remove_all(world->file(""));
+    Participant first{*world, "alice"};
+    people = {first.add("Ada"), first.add("Ben")};
+    friends = first.group("Friends", {people[0], people[1]});
+    first.publish();
+    first.pass();
+    join(laptop);
+    for (int pass = 0; pass < 3; ++pass) laptop.pass();
+    const CXPersonRef dora = laptop.add("Dora");
+    laptop.pass();
+    first.application->removeRecord(at(first, people[1]));
+    at(first, friends)->setValue(Value("Best friends"), kCXGroupNameProperty);
+    first.application->save();
+    for (int round = 0; round < 4; ++round)
+        for (Participant* each : {&first, &laptop}) each->pass();
+    EXPECT_EQ(laptop.view(), first.view()) << log.text();
+    EXPECT_FALSE(at(first, people[1])) << log.text();
+    EXPECT_EQ(at(laptop, friends)->name(), "Best friends");
+    EXPECT_EQ(nameIn(first, dora), "Dora");
 }
 
 // Nobody else may write, so the first computer took nothing in before.
