@@ -1,6 +1,7 @@
 #include "server/StoreCertificates.h"
 
 #include "foundation/CXException.h"
+#include "foundation/Fingerprint.h"
 #include "foundation/Paths.h"
 #include "foundation/Release.h"
 
@@ -147,19 +148,6 @@ std::vector<Certificate> readCertificates(const std::string& path) {
     }
     ERR_clear_error();
     return all;
-}
-
-std::string fingerprintOf(X509* certificate) {
-    unsigned char digest[EVP_MAX_MD_SIZE];
-    unsigned int size = 0;
-    if (X509_digest(certificate, EVP_sha256(), digest, &size) != 1) return {};
-    std::string text;
-    for (unsigned int i = 0; i < size; ++i) {
-        if (i > 0) text += ':';
-        text += "0123456789ABCDEF"[digest[i] >> 4];
-        text += "0123456789ABCDEF"[digest[i] & 15];
-    }
-    return text;
 }
 
 // The certificates in it are somebody else's.

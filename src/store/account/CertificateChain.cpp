@@ -1,6 +1,7 @@
 #include "store/account/CertificateChain.h"
 
 #include "foundation/CXException.h"
+#include "foundation/Fingerprint.h"
 #include "foundation/Release.h"
 
 #include <algorithm>
@@ -32,19 +33,6 @@ Date dateOf(const ASN1_TIME* time) {
     std::tm parts{};
     if (ASN1_TIME_to_tm(time, &parts) != 1) return Date();
     return Date(static_cast<double>(timegm(&parts)));
-}
-
-std::string fingerprintOf(const X509* certificate) {
-    unsigned char digest[EVP_MAX_MD_SIZE];
-    unsigned int size = 0;
-    if (X509_digest(certificate, EVP_sha256(), digest, &size) != 1) return {};
-    std::string text;
-    for (unsigned int i = 0; i < size; ++i) {
-        if (i > 0) text += ':';
-        text += "0123456789ABCDEF"[digest[i] >> 4];
-        text += "0123456789ABCDEF"[digest[i] & 15];
-    }
-    return text;
 }
 
 std::string pemOf(X509* certificate) {
