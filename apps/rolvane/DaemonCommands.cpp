@@ -256,6 +256,19 @@ std::string computerRow(const Json& computer) {
                 : tr(", last there {}", shownDate(computer["lastThere"].get<std::string>())));
 }
 
+// Has a daemon anything to do?
+bool needsDaemon(const Json& s) {
+    const Json& published = s["published"];
+    return published["everything"].get<bool>() || !published["groups"].empty() || !s["subscriptions"].empty() ||
+           !s["books"].is_null() || s["leftOnStore"].get<bool>() || s["pending"].get<size_t>() > 0;
+}
+
+std::string daemonText(const Json& s) {
+    if (!s["daemon"].is_null()) return tr("running, process {}", s["daemon"].get<int>());
+    return needsDaemon(s) ? translated("not running (`rolvane daemon start`)")
+                          : translated("not running, and nothing is shared that it would keep in step");
+}
+
 void showStatus(Context& context) {
     const Json s = status(context);
     if (!s["damaged"].is_null()) context.exitCode = kFailed;
@@ -265,8 +278,7 @@ void showStatus(Context& context) {
     row(translated("Contacts"),
         countedText(people, "person", "people") + ", " + countedText(groups, "group", "groups"));
     if (!s["damaged"].is_null()) row(translated("Database"), s["damaged"].get<std::string>());
-    row(translated("Daemon"), s["daemon"].is_null() ? translated("not running (`rolvane daemon start`)")
-                                                    : tr("running, process {}", s["daemon"].get<int>()));
+    row(translated("Daemon"), daemonText(s));
     if (s["store"].is_null()) {
         row(translated("Store"), translated("no account yet (`rolvane setup`)"));
     } else {

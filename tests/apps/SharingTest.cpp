@@ -245,6 +245,17 @@ TEST_F(Sharing, TheDaemonIsStartedFoundRestartedAndStopped) {
     EXPECT_NE(world.rolvane({"daemon", "stop"}).errors.find("was not running"), std::string::npos);
 }
 
+TEST_F(Sharing, StatusOffersTheDaemonOnlyWhereItHasSomethingToDo) {
+    world.add("Ada");
+    std::string shown = world.done({"status"});
+    EXPECT_EQ(shown.find("daemon start"), std::string::npos) << shown;
+    EXPECT_NE(shown.find("nothing is shared"), std::string::npos) << shown;
+    world.done({"publish"});
+    world.done({"daemon", "stop"});
+    shown = world.done({"status"});
+    EXPECT_NE(shown.find("not running (`rolvane daemon start`)"), std::string::npos) << shown;
+}
+
 TEST(WithoutABus, PublishSyncAndWatchWorkAllTheSame) {
     CommandWorld world;
     world.makeAccount();
