@@ -2,7 +2,9 @@
 #include "Neighbour.h"
 #include "TerminalSession.h"
 
+#include "engine/pass/PassOutcome.h"
 #include "foundation/Paths.h"
+#include "foundation/Preferences.h"
 
 #include <cstdlib>
 #include <filesystem>
@@ -145,6 +147,46 @@ TEST_F(TheDoctor, NamesDamagedPreferences) {
     const std::string command = of(told, "preferences")["toDo"];
     EXPECT_EQ(world.run({"sh", "-c", command}).status, 0);
     EXPECT_EQ(examine()["well"], true) << "the command cures it";
+}
+
+TEST_F(TheDoctor, NamesAQueueThatHasWaitedForMoreThanADay) {
+    world.makeAccount();
+    world.add("Ada");
+    ASSERT_EQ(world.rolvane({"publish"}).status, kDone);
+    ASSERT_EQ(world.rolvane({"daemon", "stop"}).status, kDone);
+    const auto waitFor = [&](double hours) {
+        Preferences preferences(world.home / "state/rolvane/preferences.db");
+        PassOutcome outcome = *lastOutcome(preferences);
+        for (PassTree& tree : outcome.trees) {
+            tree.out.waiting = 3;
+            tree.out.waitingSince = Clock::system().now().addingSeconds(-hours * 3600);
+        }
+        preferences.set(kDaemonDomain, kCXDPassOutcome, encodeOutcome(outcome));
+        preferences.synchronize(kDaemonDomain);
+    };
+    EXPECT_EQ(of(examine(kFailure), "queue")["state"], "well");
+    waitFor(23);
+    EXPECT_EQ(of(examine(kFailure), "queue")["state"], "note");
+    waitFor(25);
+    const auto told = examine(kFailure);
+    expectFailed(told, "queue", "rolvane sync");
+    EXPECT_EQ(of(told, "queue")["what"], "3 changes wait, the oldest for 25 hours.");
+}
+
+// One that is believed as well, as behind a change of the store's.
+TEST_F(TheDoctor, NamesAnAuthorityThatEndsSoon) {
+    world.makeAccount();
+    EXPECT_EQ(of(examine(), "authority")["state"], "well");
+    const std::string shortly = world.home / "shortly.pem", both = world.home / "both.pem";
+    const Ran made =
+        world.run({"openssl", "req", "-x509", "-newkey", "ec", "-pkeyopt", "ec_paramgen_curve:P-256", "-nodes", "-days",
+                   "20", "-subj", "/CN=shortly", "-keyout", world.home / "key.pem", "-out", shortly});
+    ASSERT_EQ(made.status, 0) << made;
+    std::ofstream(both) << readFile(world.store().caFile()) << readFile(shortly);
+    ASSERT_EQ(world.rolvane({"account", "set", "--ca-file", both}).status, kDone);
+    const auto finding = of(examine(), "authority");
+    EXPECT_EQ(finding["state"], "note") << finding;
+    EXPECT_EQ(finding["what"].get<std::string>().find("The store's authority is good until "), 0U) << finding;
 }
 
 // A store whose administrator has forbidden or switched off a method.
