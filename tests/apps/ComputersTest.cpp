@@ -98,6 +98,7 @@ TEST_F(Computers, JoinBringsAllOfItKeepsWhatWasHereAndBothStayInStep) {
     world.done({"sync"});
     EXPECT_EQ(onDesk(), "Ada Ben Dora ") << "the first computer has noticed by itself";
     world.done({"edit", "Ada", "--first", "Adelheid"});
+    world.done({"sync"});
     laptop->done({"sync"});
     EXPECT_EQ(onLaptop(), "Adelheid Ben Dora ");
     laptop->done({"delete", "Ben", "--yes"});
