@@ -4,7 +4,7 @@
 #include "contacts/database/DamagedDatabase.h"
 #include "contacts/records/CXMerger.h"
 #include "engine/EngineParts.h"
-#include "engine/memory/PublicationCache.h"
+#include "engine/memory/PriorStates.h"
 #include "engine/pass/ApplyLoop.h"
 #include "engine/queue/PayloadMerging.h"
 #include "engine/queue/RefusedChanges.h"

@@ -71,7 +71,7 @@ int BusPoster::send(const Notification& notification) {
     return result < 0 ? result : sd_bus_send(_bus.get(), message.get(), nullptr);
 }
 
-void BusPoster::settle() {
+void BusPoster::watchQueue() {
     uint64_t queued = 0;
     if (sd_bus_get_n_queued_write(_bus.get(), &queued) < 0) return;
     if (queued == 0) {
@@ -89,7 +89,7 @@ bool BusPoster::post(const Notification& notification) {
         if (!ready() && !connect()) return false;
         int result = send(notification);
         if (result >= 0) {
-            settle();
+            watchQueue();
             return true;
         }
         if (result == -ENOBUFS) return false;

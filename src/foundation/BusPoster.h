@@ -29,7 +29,7 @@ private:
     bool pump() REQUIRES(_mutex);
     bool ready() REQUIRES(_mutex);
     int send(const Notification& notification) REQUIRES(_mutex);
-    void settle() REQUIRES(_mutex);
+    void watchQueue() REQUIRES(_mutex);
 
     const std::optional<std::string> _address;
     int _queuedDescriptor;

@@ -252,6 +252,19 @@ TEST_F(TakenBackPass, ANewGroupKeepsTheNameThatSomebodyElseGivesBehindIt) {
     EXPECT_EQ(crew->name(), "Bob's") << log.text();
 }
 
+// The name that the first pass wrote is nobody else's, though the second one has put down another.
+TEST_F(TakenBackPass, ANameThatWaitsGivesWayToNoEarlierOneOfItsOwn) {
+    bob.pass();
+    rename(bob, groupCopy(), "First");
+    passThatIsTakenBack(bob, kAtTheEnd);
+    rename(bob, groupCopy(), "Second");
+    refuseFileOf(friends->uniqueId());
+    bob.pass();
+    bob.wire->intercept({});
+    settle();
+    EXPECT_EQ(friends->name(), "Second") << log.text();
+}
+
 // The second of the two passes has seen on the store what the first had written.
 TEST_F(TakenBackPass, AMemberWhomItsOwnerTakesOutBehindTwoOfThemStaysOut) {
     bob.pass();

@@ -16,7 +16,7 @@
 #include "contacts/vcard/VCardImport.h"
 #include "contacts/vcard/VCardReader.h"
 #include "contacts/vcard/VCardScanner.h"
-#include "engine/memory/PublicationCache.h"
+#include "engine/memory/PriorStates.h"
 #include "engine/queue/ChangeQueue.h"
 #include "engine/queue/Mingler.h"
 #include "foundation/BinaryValue.h"

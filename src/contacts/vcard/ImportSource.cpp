@@ -46,7 +46,7 @@ ImportSource ImportSource::ofFile(const std::string& path) {
     source._name = path;
     source._bytes = std::filesystem::file_size(path, error);
     source._file = std::move(file);
-    source.settle();
+    source.decode();
     return source;
 }
 
@@ -65,11 +65,11 @@ ImportSource ImportSource::ofStream(std::istream& in, const std::string& name, u
         source._bytes = static_cast<uint64_t>(source._file->tellp());
         source._file->seekg(0);
     }
-    source.settle();
+    source.decode();
     return source;
 }
 
-void ImportSource::settle() {
+void ImportSource::decode() {
     if (!beginsAsUTF16(start())) return;
     const auto converted = textFromUTF16(whole(kMostUTF16));
     if (!converted) unreadable(_name, "it begins as UTF-16 and is none. Save it as UTF-8 and import it again");

@@ -25,7 +25,7 @@ public:
     bool wasUTF16() const { return _wasUTF16; }
 
 private:
-    void settle();
+    void decode();
 
     std::string _name;
     uint64_t _bytes = 0;

@@ -4,7 +4,7 @@
 #include "contacts/database/DamagedDatabase.h"
 #include "contacts/records/Constants.h"
 #include "contacts/records/Identifier.h"
-#include "engine/memory/PublicationCache.h"
+#include "engine/memory/PriorStates.h"
 #include "engine/pass/OutOfOrderWork.h"
 #include "engine/queue/ChangeQueue.h"
 #include "engine/queue/Mingler.h"

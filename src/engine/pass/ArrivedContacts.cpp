@@ -3,7 +3,7 @@
 #include "contacts/records/Constants.h"
 #include "contacts/records/Identifier.h"
 #include "engine/memory/PassCommit.h"
-#include "engine/memory/PublicationCache.h"
+#include "engine/memory/PriorStates.h"
 #include "foundation/TestSwitch.h"
 
 #include <utility>

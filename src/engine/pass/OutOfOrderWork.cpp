@@ -1,6 +1,6 @@
 #include "engine/pass/OutOfOrderWork.h"
 
-#include "engine/memory/PublicationCache.h"
+#include "engine/memory/PriorStates.h"
 #include "engine/pass/ApplyLoop.h"
 #include "engine/queue/RefusedChanges.h"
 #include "foundation/CXException.h"

@@ -81,7 +81,7 @@ void OutcomeKeeper::couldNotStore(const std::string& exception) {
 }
 
 // The failures are taken: a second call adds those that came since.
-void OutcomeKeeper::settle() {
+void OutcomeKeeper::collect() {
     _facts.anotherFollows = _sources.anotherFollows && _sources.anotherFollows();
     try {
         if (_sources.failures)
@@ -94,7 +94,7 @@ void OutcomeKeeper::settle() {
 
 void OutcomeKeeper::put() {
     const Lock guard(_lock);
-    settle();
+    collect();
     _put = outcomeOf(_facts, _previous, _clock.now());
     _preferences.set(kDaemonDomain, kCXDPassOutcome, encodeOutcome(*_put));
 }
@@ -102,7 +102,7 @@ void OutcomeKeeper::put() {
 PassOutcome OutcomeKeeper::end() {
     const Lock guard(_lock);
     _running = false;
-    settle();
+    collect();
     PassOutcome outcome = outcomeOf(_facts, _previous, _put ? _put->ended : _clock.now());
     try {
         if (_put != outcome) {

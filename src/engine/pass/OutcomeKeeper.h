@@ -49,7 +49,7 @@ public:
     static PassOutcome endWithoutAPass(Preferences& preferences, const Clock& clock, const std::string& exception);
 
 private:
-    void settle() REQUIRES(_lock);
+    void collect() REQUIRES(_lock);
 
     Preferences& _preferences;
     const Clock& _clock;

@@ -3,7 +3,7 @@
 #include "contacts/database/CXRolvane.h"
 #include "contacts/records/Constants.h"
 #include "contacts/records/Identifier.h"
-#include "engine/memory/PublicationCache.h"
+#include "engine/memory/PriorStates.h"
 #include "engine/queue/ChangeQueue.h"
 #include "engine/queue/RefusedChanges.h"
 #include "engine/recovery/UnderWay.h"

@@ -58,7 +58,7 @@ bool groupsContradict(const CXDChangeRecord& a, const CXDChangeRecord& b) {
 enum class Outcome { nothing, elementLoses, recordLoses };
 
 // The group test writes no "Rejecting" line: a group's contradictions come in crowds.
-Outcome settle(const CXDChangeRecord& record, const CXDChangeRecord& element) {
+Outcome judge(const CXDChangeRecord& record, const CXDChangeRecord& element) {
     Outcome outcome = Outcome::nothing;
     if (personsContradict(record, element)) {
         CXDLog("Possible conflict:\n\t%@\n\t%@", record, element);
@@ -299,7 +299,7 @@ private:
             Elements::Element& element = _elements[*link];
             const bool mayContradict = element.isRemoval != isRemoval(record);
             if (!mayContradict && element.hash == hash && list[element.record]->isEqual(record)) return false;
-            const Outcome outcome = mayContradict ? settle(record, *list[element.record]) : Outcome::nothing;
+            const Outcome outcome = mayContradict ? judge(record, *list[element.record]) : Outcome::nothing;
             if (outcome == Outcome::recordLoses) return false;
             if (outcome == Outcome::elementLoses) {
                 list.removeEqual(list[element.record]);
@@ -317,7 +317,7 @@ private:
         const uint32_t stop = index.findEqual(record, hash);
         for (const uint32_t candidate : index.candidates(record, stop)) {
             const CXDChangeRecordPtr& element = list[_elements[candidate].record];
-            const Outcome outcome = settle(record, *element);
+            const Outcome outcome = judge(record, *element);
             if (outcome == Outcome::recordLoses) return false;
             if (outcome == Outcome::elementLoses) {
                 list.removeEqual(element);

@@ -33,7 +33,7 @@ Dictionary unsettledOfOthers(const CXDChangeRecords& records, size_t fresh) {
 } // namespace
 
 void PassRecovery::begin(CXDChangeRecords& records, size_t fresh) {
-    // Of a pass that was killed, or what an earlier one left adrift.
+    // Of a pass that was killed, or what an earlier one left unsettled.
     _underWay = underWayInAnyForm(_parts.state.underWay());
     _unsettled = unsettledOfOthers(records, fresh);
     restatement().restate(records, fresh);
@@ -81,22 +81,22 @@ void PassRecovery::lostInFolds(const LostInFolds& lost) {
     for (const auto& groups : {lost.lists, lost.contents})
         for (const UniqueId& group : groups)
             if (!isLeftOut("lost in folds")) _unsettled.set(group.str(), true);
-    for (const UniqueId& group : lost.contents) noteUnsure(group);
+    for (const UniqueId& group : lost.contents) noteUnsettled(group);
 }
 
 void PassRecovery::compareAgain(const UniqueId& group) {
     _unsettled.set(group.str(), true);
-    noteUnsure(group);
+    noteUnsettled(group);
 }
 
-void PassRecovery::noteUnsure(const UniqueId& group) {
-    if (isLeftOut("unsure groups")) return;
-    _end.unsureGroups.insert(cxUIDWithTableName(group, kCXGroupTable));
+void PassRecovery::noteUnsettled(const UniqueId& group) {
+    if (isLeftOut("unsettled changes")) return;
+    _end.unsettledGroups.insert(cxUIDWithTableName(group, kCXGroupTable));
 }
 
 bool PassRecovery::end(const CXDChangeRecords& left) {
     if (!_parts.vaultraOffLine()) _end.unread = underWayTogether(_end.unread, mayHaveArrived(left));
-    _end.unsureGroups.merge(groupsOf(ownWrites(left)));
+    _end.unsettledGroups.merge(groupsOf(ownWrites(left)));
     _end.everythingIsPublished = isPublished(*_parts.with.rolvane.allGroup());
     if (_unsettled.empty() || isLeftOut("unsettled groups")) return false;
     _parts.state.conduitObjectForKey(kConduitCX, kUnsettledGroups).addEntriesFrom(_unsettled);
@@ -110,7 +110,8 @@ Dictionary PassRecovery::mayHaveArrived(const CXDChangeRecords& left) const {
     std::copy_if(left.begin(), left.end(), std::back_inserter(ofGroups), [](const CXDChangeRecordPtr& record) {
         return record->user() != kSelf && record->type() != CXDUpdateRecord;
     });
-    const Dictionary all = withSubscriptions(underWay(ofGroups));
+    const Dictionary waits = withSubscriptions(underWay(ofGroups));
+    const Dictionary all = isLeftOut("names before") ? waits : withNamesBefore(waits, *_underWay);
     Dictionary subscribed;
     for (const auto& [user, of] : all)
         if (of.dictionary().contains(kSubscription)) subscribed.set(user, of);
@@ -119,8 +120,9 @@ Dictionary PassRecovery::mayHaveArrived(const CXDChangeRecords& left) const {
 
 void PassRecovery::storeNote() {
     if (_underWay)
-        _parts.state.setUnderWay(isLeftOut("adrift") ? Dictionary()
-                                                     : adrift(*_underWay, _parts.state.conduitData(), _end));
+        _parts.state.setUnderWay(isLeftOut("unsettled writes")
+                                     ? Dictionary()
+                                     : unsettledAfter(*_underWay, _parts.state.conduitData(), _end));
 }
 
 // The own one, and those of others whose subscription is still the one by which the copies came.

@@ -47,7 +47,7 @@ private:
     Dictionary withSubscriptions(Dictionary underWay) const;
     Dictionary mayHaveArrived(const CXDChangeRecords& left) const;
     std::vector<std::pair<UserName, CXSubscriptionRef>> subscriptionsOf(const Dictionary& underWay) const;
-    void noteUnsure(const UniqueId& group); // one of the owner's
+    void noteUnsettled(const UniqueId& group); // one of the owner's
 
     EngineParts& _parts;
     std::optional<Dictionary> _underWay; // none: the note of it was not read yet, and stays as it is

@@ -4,7 +4,7 @@
 #include "contacts/records/CXGroup.h"
 #include "contacts/records/Constants.h"
 #include "contacts/records/Identifier.h"
-#include "engine/memory/PublicationCache.h"
+#include "engine/memory/PriorStates.h"
 #include "engine/recovery/Holdings.h"
 #include "model/PayloadKeys.h"
 #include "model/RemoteLocationMap.h"
@@ -278,16 +278,16 @@ void addUnlisted(Dictionary& left, const Dictionary& own, const Dictionary& cond
         lists[i++] = groups[kCXAllGroupUID].dictionary();
     }
     if (!listed && !touchedGroups.contains(kCXAllGroupUID)) return;
-    const auto isAdrift = [&](const std::string& name, const char* list) {
+    const auto isUnsettled = [&](const std::string& name, const char* list) {
         return !removed.contains(UniqueId(name)) && std::any_of(lists.begin(), lists.end(), [&](const Dictionary& all) {
             return !all[list].array().containsString(name);
         });
     };
     for (const Value& person : own[kPeople].array())
-        if (isAdrift(person.string(), kMemberUIDState)) left.arrayFor(kPeople).append(person);
+        if (isUnsettled(person.string(), kMemberUIDState)) left.arrayFor(kPeople).append(person);
     for (const auto& [group, touched] : touchedGroups)
-        if (group == kCXAllGroupUID ? !listed : isAdrift(group, kSubgroupUIDState))
-            left.dictionaryFor(kGroups).dictionaryFor(group);
+        if (group == kCXAllGroupUID ? !listed : isUnsettled(group, kSubgroupUIDState))
+            left.dictionaryFor(kGroups).set(group, touched);
 }
 
 } // namespace
@@ -347,6 +347,16 @@ Dictionary withoutNames(const Dictionary& underWay, const Dictionary& namesOfOth
     return without;
 }
 
+Dictionary withNamesBefore(const Dictionary& underWay, const Dictionary& former) {
+    Dictionary both = Value(underWay).deepMutableCopy().dictionary();
+    for (const auto& [user, of] : both)
+        for (const auto& [group, touched] : of.dictionary()[kGroups].dictionary())
+            if (touched.dictionary().contains(kNames))
+                addEach(touched.dictionary()[kNames].array(),
+                        former[user].dictionary()[kGroups].dictionary()[group].dictionary()[kNames]);
+    return both;
+}
+
 std::unordered_set<UniqueId> removedBy(const CXDChangeRecords& records) {
     std::unordered_set<UniqueId> removed;
     for (const CXDChangeRecordPtr& record : records) {
@@ -373,11 +383,11 @@ std::unordered_set<UniqueId> groupsOf(const CXDChangeRecords& ownWrites) {
     return groups;
 }
 
-Dictionary adrift(const Dictionary& underWay, const Dictionary& conduitData, const PassEnd& end) {
+Dictionary unsettledAfter(const Dictionary& underWay, const Dictionary& conduitData, const PassEnd& end) {
     const Dictionary own = underWay[kSelf.str()].dictionary();
     Dictionary left;
     for (const auto& [group, touched] : own[kGroups].dictionary())
-        if (end.unsureGroups.contains(UniqueId(group)) && !end.removed.contains(UniqueId(group)))
+        if (end.unsettledGroups.contains(UniqueId(group)) && !end.removed.contains(UniqueId(group)))
             left.dictionaryFor(kGroups).set(group, touched);
     if (end.everythingIsPublished) addUnlisted(left, own, conduitData, end.removed);
     return left.empty() ? end.unread : underWayTogether(end.unread, Dictionary{{kSelf.str(), left}});

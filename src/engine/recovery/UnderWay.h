@@ -23,6 +23,8 @@ Dictionary underWay(const CXDChangeRecords& records);
 inline constexpr const char* kSubscription = "subscription"; // to the tree of somebody else; set by the caller
 // Without those names, by group, which are not the pass's own.
 Dictionary withoutNames(const Dictionary& underWay, const Dictionary& namesOfOthers);
+// Where it names a group, also the names that an earlier note has for it: one of them may be on the store.
+Dictionary withNamesBefore(const Dictionary& underWay, const Dictionary& former);
 // A note of an earlier version knew the own tree alone, and had no user in it.
 Dictionary underWayInAnyForm(const Dictionary& stored);
 // Both together; neither is changed.
@@ -49,10 +51,10 @@ SettledUnderWay settleUnderWay(const Dictionary& underWay, const SharedTree& tre
 
 // What is known at the end of a pass, identifiers in their shared form.
 struct PassEnd {
-    std::unordered_set<UniqueId> removed;      // people and groups that it took from the store, or has still to take
-    std::unordered_set<UniqueId> unsureGroups; // whose changes wait, or may have been lost
-    bool everythingIsPublished = false;        // and not single groups only
-    Dictionary unread;                         // under way in trees that were not read, or whose changes wait
+    std::unordered_set<UniqueId> removed;         // people and groups that it took from the store, or has still to take
+    std::unordered_set<UniqueId> unsettledGroups; // whose changes wait, or may have been lost
+    bool everythingIsPublished = false;           // and not single groups only
+    Dictionary unread;                            // under way in trees that were not read, or whose changes wait
 };
 std::unordered_set<UniqueId> removedBy(const CXDChangeRecords& records);
 bool isOwnWrite(const CXDChangeRecord& record); // of the owner's, to the network store
@@ -63,6 +65,6 @@ std::unordered_set<UniqueId> groupsOf(const CXDChangeRecords& ownWrites);
 // which that is not sure, and who or what is not in both lists of all that are known. Where a change of the list of all
 // was lost or waits, a contact that is on the store already could leave the database without anybody's noticing. Where
 // single groups are published, that list says little, and nothing is removed from the store one by one.
-Dictionary adrift(const Dictionary& underWay, const Dictionary& conduitData, const PassEnd& end);
+Dictionary unsettledAfter(const Dictionary& underWay, const Dictionary& conduitData, const PassEnd& end);
 
 } // namespace rolvane

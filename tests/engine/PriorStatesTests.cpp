@@ -1,4 +1,4 @@
-#include "engine/memory/PublicationCache.h"
+#include "engine/memory/PriorStates.h"
 
 #include "Records.h"
 #include "contacts/records/Identifier.h"
@@ -157,7 +157,7 @@ CXDChangeRecordPtr arbitraryApplied() {
     return makeRecord(type, person, group, {4, 4, user}, payload);
 }
 
-RC_GTEST_PROP(PublicationCache, FoldsAsTheLiteralCacheDoes, ()) {
+RC_GTEST_PROP(PriorStates, FoldsAsTheLiteralCacheDoes, ()) {
     Dictionary data;
     LiteralCache literal;
     const int count = *rc::gen::inRange(0, 60);
@@ -176,14 +176,14 @@ RC_GTEST_PROP(PublicationCache, FoldsAsTheLiteralCacheDoes, ()) {
     RC_ASSERT(got.dictionary() == expected);
 }
 
-TEST(PublicationCache, ARecordFromTheContactDatabaseUpdatesBothSources) {
+TEST(PriorStates, ARecordFromTheContactDatabaseUpdatesBothSources) {
     Dictionary data;
     didApplyChange(data, *makeRecord(CXDAddRecordToGroup, "P1:CXPerson", "G1:CXGroup"), CXDSyncSourceVaultra);
     for (const char* conduit : {"CXDVaultra", "CXDCX"})
         EXPECT_EQ(groupState(data, conduit, "<self>", "G1:CXGroup")["memberUIDState"], Value(Array{"P1:CXPerson"}));
 }
 
-TEST(PublicationCache, ARecordAppliedToItsInitialSourceUpdatesItOnce) {
+TEST(PriorStates, ARecordAppliedToItsInitialSourceUpdatesItOnce) {
     Dictionary data;
     didApplyChange(data,
                    *makeRecord(CXDCompositeGroupChange, nullptr, "G1:CXGroup", {4, 4, "<self>"},
@@ -192,7 +192,7 @@ TEST(PublicationCache, ARecordAppliedToItsInitialSourceUpdatesItOnce) {
     EXPECT_EQ(groupState(data, "CXDVaultra", "<self>", "G1:CXGroup")["memberUIDState"].array().count(), 1u);
 }
 
-TEST(PublicationCache, ThePendingSourceAndSourcesWithoutAConduitChangeNothing) {
+TEST(PriorStates, ThePendingSourceAndSourcesWithoutAConduitChangeNothing) {
     for (const int32_t source : {0, 8, 16, 5}) {
         Dictionary data;
         updateCache(data, source, *makeRecord(CXDAddRecordToGroup, "P1:CXPerson", "G1:CXGroup"));
@@ -200,7 +200,7 @@ TEST(PublicationCache, ThePendingSourceAndSourcesWithoutAConduitChangeNothing) {
     }
 }
 
-TEST(PublicationCache, AMemberAddedByTwoCompositesIsListedTwiceAndByTwoAdditionsOnce) {
+TEST(PriorStates, AMemberAddedByTwoCompositesIsListedTwiceAndByTwoAdditionsOnce) {
     Dictionary data;
     const Dictionary adds{{"memberAdds", Array{"P1:CXPerson"}}};
     for (int i = 0; i < 2; ++i) {
@@ -211,7 +211,7 @@ TEST(PublicationCache, AMemberAddedByTwoCompositesIsListedTwiceAndByTwoAdditions
               Value(Array{"P1:CXPerson", "P2:CXPerson", "P1:CXPerson"}));
 }
 
-TEST(PublicationCache, RemovingFromAGroupWithoutStateCreatesNothing) {
+TEST(PriorStates, RemovingFromAGroupWithoutStateCreatesNothing) {
     Dictionary data;
     for (const int32_t type : {258, 259, 9, 7, 8}) {
         updateCache(data, 4, *makeRecord(type, "P1:CXPerson", "G1:CXGroup", {}, "payload"));
@@ -219,7 +219,7 @@ TEST(PublicationCache, RemovingFromAGroupWithoutStateCreatesNothing) {
     }
 }
 
-TEST(PublicationCache, IdentifiersAreNormalisedAndTheSubgroupsAsGroups) {
+TEST(PriorStates, IdentifiersAreNormalisedAndTheSubgroupsAsGroups) {
     Dictionary data;
     updateCache(data, 4, *makeRecord(CXDAddGroupToGroup, "G2:CXSubscribedGroup", "AllCXSubscribedGroup"));
     updateCache(data, 4, *makeRecord(CXDAddRecordToGroup, "P1:CXSubscribedPerson", "AllCXSubscribedGroup"));
@@ -228,7 +228,7 @@ TEST(PublicationCache, IdentifiersAreNormalisedAndTheSubgroupsAsGroups) {
     EXPECT_EQ(state["memberUIDState"], Value(Array{"P1:CXPerson"}));
 }
 
-TEST(PublicationCache, ADeletedGroupIsForgotten) {
+TEST(PriorStates, ADeletedGroupIsForgotten) {
     Dictionary data;
     updateCache(data, 4, *makeRecord(CXDCreateStructureForGroup, nullptr, "G1:CXGroup"));
     EXPECT_TRUE(hasGroup(data, "CXDVaultra", "<self>", "G1:CXGroup"));
@@ -243,7 +243,7 @@ Dictionary publishedAt(std::initializer_list<const char*> conduits, const char* 
     return data;
 }
 
-TEST(PublicationCache, SourcesOfAGroupAreTheStoresThatHoldIt) {
+TEST(PriorStates, SourcesOfAGroupAreTheStoresThatHoldIt) {
     const UniqueId group("G1:CXGroup");
     EXPECT_EQ(sourcesForGUID({}, group), 0);
     EXPECT_EQ(sourcesForGUID(publishedAt({"CXDVaultra", "CXDLocal"}, "ann"), group), 6);
@@ -253,7 +253,7 @@ TEST(PublicationCache, SourcesOfAGroupAreTheStoresThatHoldIt) {
     EXPECT_EQ(sourcesForGUID(odd, group), 0) << "a damaged entry is nobody's";
 }
 
-TEST(PublicationCache, AGroupIsLookedForWithEveryUserOfASource) {
+TEST(PriorStates, AGroupIsLookedForWithEveryUserOfASource) {
     const UniqueId group("G2:CXGroup");
     for (const char* holder : {"ann", "bob", "eve"}) {
         Dictionary data;
@@ -269,12 +269,12 @@ TEST(PublicationCache, AGroupIsLookedForWithEveryUserOfASource) {
     EXPECT_EQ(sourcesForGUID(both, UniqueId("G1:CXGroup")), 4) << "with two users, once";
 }
 
-TEST(PublicationCache, AGroupIsPublishedWhenTheOwnersStateHasIt) {
+TEST(PriorStates, AGroupIsPublishedWhenTheOwnersStateHasIt) {
     EXPECT_TRUE(isGUIDPublished(publishedAt({"CXDCX"}, "<self>"), UniqueId("G1:CXGroup")));
     EXPECT_FALSE(isGUIDPublished(publishedAt({"CXDVaultra"}, "ann"), UniqueId("G1:CXGroup")));
 }
 
-TEST(PublicationCache, ARemovedGroupLeavesEveryUserOfEveryConduit) {
+TEST(PriorStates, ARemovedGroupLeavesEveryUserOfEveryConduit) {
     Dictionary data = publishedAt({"CXDCX", "CXDVaultra"}, "<self>");
     data.addEntriesFrom(publishedAt({"CXDLocal"}, "ann"));
     removeGUID(data, UniqueId("G1:CXGroup"));

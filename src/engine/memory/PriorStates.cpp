@@ -1,4 +1,4 @@
-#include "engine/memory/PublicationCache.h"
+#include "engine/memory/PriorStates.h"
 
 #include "contacts/records/Constants.h"
 #include "contacts/records/Identifier.h"
