@@ -100,6 +100,23 @@ TEST_F(LeftUnsettled, TheNameOfANewGroupStaysNotedBehindAPassThatDoesNotSpeakOfI
     EXPECT_EQ(groups[kGroup].dictionary()["names"], Value(Array{"Friends"})) << Value(groups).description();
 }
 
+TEST_F(LeftUnsettled, AGroupStaysNotedWhereAFoldHasLostAnEarlierChangeOfIt) {
+    for (const char* conduit : {kConduitCX, kConduitVaultra})
+        world.engine->conduitObjectForKey(conduit, kPriorState)["<self>"]
+            .dictionary()[kAll]
+            .dictionary()[kSubgroupUIDState]
+            .array()
+            .append(Value(kGroup));
+    pass({own(CXDCompositeGroupChange, nullptr, kGroup, Dictionary{{kMemberAdds, Array{kPerson}}}),
+          own(CXDAddRecordToGroup, "Q:CXPerson", kGroup)});
+    const auto noted = [&] {
+        return world.stored(kCXDUnderWay).dictionary()["<self>"].dictionary()["groups"].dictionary();
+    };
+    EXPECT_TRUE(noted().contains(kGroup));
+    pass({own(CXDAddRecordToGroup, "R:CXPerson", kGroup)});
+    EXPECT_FALSE(noted().contains(kGroup));
+}
+
 TEST_F(LeftUnsettled, ARemovalThatStillWaitsIsSentAgainWhenItIsLost) {
     refused = {CXDDeleteRecord};
     pass({own(CXDDeleteRecord, kPerson, nullptr)});
