@@ -17,7 +17,7 @@
 #include "contacts/records/Identifier.h"
 #include "contacts/vcard/VCardImport.h"
 #include "engine/memory/EngineState.h"
-#include "engine/memory/PublicationCache.h"
+#include "engine/memory/PriorStates.h"
 #include "engine/queue/ChangeQueue.h"
 #include "engine/queue/Mingler.h"
 #include "foundation/BinaryValue.h"

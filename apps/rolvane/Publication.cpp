@@ -9,7 +9,7 @@
 #include "contacts/records/Identifier.h"
 #include "contacts/records/SharingDates.h"
 #include "engine/memory/EngineState.h"
-#include "engine/memory/PublicationCache.h"
+#include "engine/memory/PriorStates.h"
 #include "engine/queue/RefusedChanges.h"
 #include "model/Computers.h"
 #include "model/RemoteLocationMap.h"
