@@ -186,21 +186,21 @@ private:
             return network.startMonitoring(_loop, NotificationCenter::defaultCenter());
         _timer.emplace(_loop, [this] { _ownPasses->wake(); });
         _sleep.emplace(_loop, [this] { networkChanged(); });
-        OwnPasses::World world;
-        world.now = secondsSinceBoot;
-        world.wakeAt = [this](std::optional<double> at) { _timer->set(at); };
-        world.lookInterval = [this] {
+        OwnPasses::Collaborators with;
+        with.now = secondsSinceBoot;
+        with.wakeAt = [this](std::optional<double> at) { _timer->set(at); };
+        with.lookInterval = [this] {
             return _news && _news->isLive() ? OwnPasses::lookIntervalWithNews(lookInterval()) : lookInterval();
         };
-        world.askStore = [&store] { return askStore(store); };
+        with.askStore = [&store] { return askStore(store); };
         _treesAhead.emplace(_loop, store);
-        world.prepare = [this](std::function<void()> done) { return _treesAhead->begin(_basesRead, std::move(done)); };
-        world.pass = [] { ownPass(); };
-        world.networkIsBack = [this] {
+        with.prepare = [this](std::function<void()> done) { return _treesAhead->begin(_basesRead, std::move(done)); };
+        with.pass = [] { ownPass(); };
+        with.networkIsBack = [this] {
             NotificationCenter::defaultCenter().post({kCXNetworkConfigurationDidChangeNotification, std::nullopt, {}});
             return OwnPasses::Answer{!_vaultra->vaultraOffLine(), 0};
         };
-        _ownPasses.emplace(std::move(world));
+        _ownPasses.emplace(std::move(with));
         _networkChanged = _networkNews.observe(kCXNetworkConfigurationDidChangeNotification,
                                                [this](const Notification&) { networkChanged(); });
         makeNewsWatch(store);
@@ -209,18 +209,18 @@ private:
 
     void makeNewsWatch(CXDAVManager& store) {
         _newsTimer.emplace(_loop, [this] { _news->wake(); });
-        NewsWatch::World world;
-        world.now = secondsSinceBoot;
-        world.wakeAt = [this](std::optional<double> at) { _newsTimer->set(at); };
-        world.random = [this] { return std::uniform_real_distribution<double>(0, 1)(_random); };
-        world.isWanted = [] { return wantsNews(); };
-        world.open = [this, &store](const std::vector<Url>& trees, const std::string& position,
-                                    NewsWatch::Listener listener) {
+        NewsWatch::Collaborators with;
+        with.now = secondsSinceBoot;
+        with.wakeAt = [this](std::optional<double> at) { _newsTimer->set(at); };
+        with.random = [this] { return std::uniform_real_distribution<double>(0, 1)(_random); };
+        with.isWanted = [] { return wantsNews(); };
+        with.open = [this, &store](const std::vector<Url>& trees, const std::string& position,
+                                   NewsWatch::Listener listener) {
             return StoreNewsRequest::open(_loop, store, trees, position, std::move(listener));
         };
-        world.news = [this](double spread) { _ownPasses->newsCame(spread); };
-        world.livelinessChanged = [this] { _ownPasses->lookIntervalChanged(); };
-        _news.emplace(std::move(world));
+        with.news = [this](double spread) { _ownPasses->newsCame(spread); };
+        with.livelinessChanged = [this] { _ownPasses->lookIntervalChanged(); };
+        _news.emplace(std::move(with));
     }
 
     // Who never looks for other people's news by itself does not want to hear of them either. With the variable every
@@ -294,19 +294,19 @@ private:
 
     EngineConduits makeConduits(ConduitEngine& engine, CXDAVManager& store) {
         auto vaultra = std::make_unique<CXDVaultraConduit>(
-            engine, CXDVaultraConduit::World{store,
-                                             CXNetworkController::sharedNetworkController(),
-                                             Preferences::shared(),
-                                             Clock::system(),
-                                             NotificationCenter::defaultCenter(),
-                                             _channel,
-                                             _alert,
-                                             CXRolvane::sharedLocalRolvane(),
-                                             {},
-                                             &_withdrawals});
-        auto cx = std::make_unique<CXDCXConduit>(engine, CXDCXConduit::World{CXRolvane::sharedLocalRolvane(),
-                                                                             Preferences::shared(), Clock::system(),
-                                                                             NotificationCenter::defaultCenter()});
+            engine, CXDVaultraConduit::Collaborators{store,
+                                                     CXNetworkController::sharedNetworkController(),
+                                                     Preferences::shared(),
+                                                     Clock::system(),
+                                                     NotificationCenter::defaultCenter(),
+                                                     _channel,
+                                                     _alert,
+                                                     CXRolvane::sharedLocalRolvane(),
+                                                     {},
+                                                     &_withdrawals});
+        auto cx = std::make_unique<CXDCXConduit>(
+            engine, CXDCXConduit::Collaborators{CXRolvane::sharedLocalRolvane(), Preferences::shared(), Clock::system(),
+                                                NotificationCenter::defaultCenter()});
         _vaultra = vaultra.get();
         return {std::move(cx), std::move(vaultra), [this] { return _vaultra->vaultraOffLine(); }};
     }

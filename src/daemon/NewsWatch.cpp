@@ -36,20 +36,20 @@ void NewsWatch::wake() {
 }
 
 void NewsWatch::arm() {
-    const bool wanted = _reached && !_trees.empty() && _world.isWanted();
-    if (_request && !_world.isWanted()) _request.reset();
+    const bool wanted = _reached && !_trees.empty() && _with.isWanted();
+    if (_request && !_with.isWanted()) _request.reset();
     if (!wanted && !_request) setLive(false);
-    if (_request || !wanted) return _world.wakeAt(std::nullopt);
-    if (_notBefore > _world.now()) return _world.wakeAt(_notBefore);
-    _world.wakeAt(std::nullopt);
+    if (_request || !wanted) return _with.wakeAt(std::nullopt);
+    if (_notBefore > _with.now()) return _with.wakeAt(_notBefore);
+    _with.wakeAt(std::nullopt);
     open();
 }
 
 void NewsWatch::open() {
     _begun.reset();
     _refused.clear();
-    _request = _world.open(_trees, _position,
-                           {[this](const NewsLine& line) { take(line); }, [this](const NewsEnd& how) { end(how); }});
+    _request = _with.open(_trees, _position,
+                          {[this](const NewsLine& line) { take(line); }, [this](const NewsEnd& how) { end(how); }});
     if (!_request) setLive(false);
 }
 
@@ -58,32 +58,32 @@ void NewsWatch::take(const NewsLine& line) {
     switch (line.kind) {
     case NewsLine::Kind::begin:
         CXDLog("The store tells of news from now on.");
-        _begun = _world.now();
+        _begun = _with.now();
         _hasBegun = true;
         setLive(true);
         return;
     case NewsLine::Kind::no:
         _refused.insert(line.tree);
         // A right that has gone meanwhile is news as well. The pass finds out about it.
-        if (_knowsRefused && !_refusedBefore.contains(line.tree)) _world.news(_world.random() * kPassSpread);
+        if (_knowsRefused && !_refusedBefore.contains(line.tree)) _with.news(_with.random() * kPassSpread);
         return;
-    case NewsLine::Kind::news: return _world.news(_world.random() * kPassSpread);
+    case NewsLine::Kind::news: return _with.news(_with.random() * kPassSpread);
     case NewsLine::Kind::still: return;
     }
 }
 
 double NewsWatch::pauseAfter(const NewsEnd& how) {
-    const double lived = _begun ? _world.now() - *_begun : 0;
+    const double lived = _begun ? _with.now() - *_begun : 0;
     if (lived >= kGood) {
         _failures = 0;
-        return _world.random() * kSpread;
+        return _with.random() * kSpread;
     }
     const bool refused = how.status >= 400;
     const double first = refused ? kFirstPauseRefused : kFirstPause;
     const double longest = refused ? kLongestPauseRefused : kLongestPause;
     constexpr int kDoublings = 20; // by then it is the longest
     const double pause = std::min(longest, first * std::exp2(std::min(_failures++, kDoublings)));
-    return pause * (1 + _world.random() / 4);
+    return pause * (1 + _with.random() / 4);
 }
 
 void NewsWatch::end(const NewsEnd& how) {
@@ -102,13 +102,13 @@ void NewsWatch::end(const NewsEnd& how) {
     // Nobody answered, or the password is refused: the next pass finds out more.
     if (!good && (how.status == 0 || how.status == kUnauthorized)) _reached = false;
     if (!good || _failures > 0) setLive(false);
-    if (!good && how.status == 0 && std::exchange(_hasBegun, false)) _world.news(_world.random() * kSpread);
-    _notBefore = _world.now() + pause;
+    if (!good && how.status == 0 && std::exchange(_hasBegun, false)) _with.news(_with.random() * kSpread);
+    _notBefore = _with.now() + pause;
     arm();
 }
 
 void NewsWatch::setLive(bool live) {
-    if (std::exchange(_live, live) != live) _world.livelinessChanged();
+    if (std::exchange(_live, live) != live) _with.livelinessChanged();
 }
 
 } // namespace rolvane

@@ -39,7 +39,7 @@ public:
         std::function<void(const NewsEnd&)> ended;
     };
     // Everything that it touches. Exists so that tests can replace it.
-    struct World {
+    struct Collaborators {
         std::function<double()> now; // seconds since the machine was started, time asleep included
         // Calls `wake` at that time, and not at the one given before; none: not at all.
         std::function<void(std::optional<double> at)> wakeAt;
@@ -51,7 +51,7 @@ public:
         std::function<void(double spreadSeconds)> news; // somebody has changed something
         std::function<void()> livelinessChanged;        // isLive is another one
     };
-    explicit NewsWatch(World world) : _world(std::move(world)) {}
+    explicit NewsWatch(Collaborators with) : _with(std::move(with)) {}
 
     // Any pass, and which trees concern this user now.
     void passEnded(const PassResult& pass, std::vector<Url> trees);
@@ -68,7 +68,7 @@ private:
     void setLive(bool live);
     double pauseAfter(const NewsEnd& how);
 
-    World _world;
+    Collaborators _with;
     std::unique_ptr<Request> _request;
     std::vector<Url> _trees;
     std::set<size_t> _refused, _refusedBefore; // trees of which nothing is told

@@ -14,7 +14,7 @@ double OwnPasses::lookIntervalWithNews(double lookInterval) {
 }
 
 void OwnPasses::newsCame(double spreadSeconds) {
-    _schedule.newsCame(_world.now() + spreadSeconds);
+    _schedule.newsCame(_with.now() + spreadSeconds);
     arm();
 }
 
@@ -23,8 +23,8 @@ void OwnPasses::lookIntervalChanged() {
 }
 
 void OwnPasses::arm() {
-    const auto next = _schedule.next(_world.lookInterval());
-    _world.wakeAt(next && !waitsForPreparation(next->what) ? std::optional(next->at) : std::nullopt);
+    const auto next = _schedule.next(_with.lookInterval());
+    _with.wakeAt(next && !waitsForPreparation(next->what) ? std::optional(next->at) : std::nullopt);
 }
 
 bool OwnPasses::waitsForPreparation(RetrySchedule::What what) const {
@@ -32,12 +32,12 @@ bool OwnPasses::waitsForPreparation(RetrySchedule::What what) const {
 }
 
 void OwnPasses::passEnded(const PassResult& pass) {
-    _schedule.ended(pass, _world.now());
+    _schedule.ended(pass, _with.now());
     arm();
 }
 
 void OwnPasses::networkChanged() {
-    _schedule.networkChanged(_world.now());
+    _schedule.networkChanged(_with.now());
     arm();
 }
 
@@ -50,21 +50,21 @@ void OwnPasses::doWhatIsDue(bool prepared) {
         OwnPasses& own;
         ~Rearmed() { own.arm(); }
     } rearmed{*this};
-    const auto next = _schedule.next(_world.lookInterval());
-    if (!next || next->at > _world.now() || waitsForPreparation(next->what)) return;
-    if (next->what == RetrySchedule::What::pass && !prepared && _world.prepare) {
-        _preparing = _world.prepare([this] {
+    const auto next = _schedule.next(_with.lookInterval());
+    if (!next || next->at > _with.now() || waitsForPreparation(next->what)) return;
+    if (next->what == RetrySchedule::What::pass && !prepared && _with.prepare) {
+        _preparing = _with.prepare([this] {
             _preparing = false;
             doWhatIsDue(true);
         });
         if (_preparing) return;
     }
-    _schedule.beginsAttempt(_world.now());
-    if (next->what == RetrySchedule::What::pass) return _world.pass();
+    _schedule.beginsAttempt(_with.now());
+    if (next->what == RetrySchedule::What::pass) return _with.pass();
     const bool asks = next->what == RetrySchedule::What::ask;
-    const Answer answer = asks ? _world.askStore() : _world.networkIsBack();
-    if (!answer.isThere) return _schedule.storeWasAway(_world.now(), answer.retryAfter);
-    if (asks) _world.pass();
+    const Answer answer = asks ? _with.askStore() : _with.networkIsBack();
+    if (!answer.isThere) return _schedule.storeWasAway(_with.now(), answer.retryAfter);
+    if (asks) _with.pass();
 }
 
 } // namespace rolvane

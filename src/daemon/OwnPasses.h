@@ -22,7 +22,7 @@ public:
         double retryAfter = 0; // seconds; 0: the store did not say
     };
     // Everything that it touches. Exists so that tests can replace it.
-    struct World {
+    struct Collaborators {
         std::function<double()> now; // seconds since the machine was started, time asleep included
         // Calls `wake` at that time, and not at the one given before; none: not at all.
         std::function<void(std::optional<double> at)> wakeAt;
@@ -35,7 +35,7 @@ public:
         // called, where there is no such thing; else `done` comes on the main thread, later, and always. May be empty.
         std::function<bool(std::function<void()> done)> prepare = {};
     };
-    explicit OwnPasses(World world) : _world(std::move(world)) {}
+    explicit OwnPasses(Collaborators with) : _with(std::move(with)) {}
 
     void passEnded(const PassResult& pass);
     void networkChanged();               // also: the machine has slept
@@ -47,7 +47,7 @@ private:
     void arm();
     void doWhatIsDue(bool prepared);
     bool waitsForPreparation(RetrySchedule::What what) const;
-    World _world;
+    Collaborators _with;
     RetrySchedule _schedule;
     bool _preparing = false;
 };

@@ -19,13 +19,13 @@ std::optional<double> Watchdog::limitOfTheManager() {
     return static_cast<double>(microseconds) / kMicroseconds;
 }
 
-Watchdog::World Watchdog::platform() {
+Watchdog::Collaborators Watchdog::platform() {
     return {[] { sd_notify(0, "WATCHDOG=1"); }, secondsSinceBoot};
 }
 
-Watchdog::Watchdog(RunLoop& loop, double limit, World world)
-    : _loop(loop), _pause(limit / kFeedsInALimit), _world(std::move(world)), _fed(_world.now()) {
-    _world.feed();
+Watchdog::Watchdog(RunLoop& loop, double limit, Collaborators with)
+    : _loop(loop), _pause(limit / kFeedsInALimit), _with(std::move(with)), _fed(_with.now()) {
+    _with.feed();
     _timer = _loop.scheduleTimer(_pause, [this] { turn(); });
 }
 
@@ -35,10 +35,10 @@ void Watchdog::turn() {
 }
 
 void Watchdog::sign() {
-    const double now = _world.now();
+    const double now = _with.now();
     double fed = _fed.load();
     if (now - fed < _pause) return;
-    if (_fed.compare_exchange_strong(fed, now)) _world.feed(); // another thread has fed otherwise
+    if (_fed.compare_exchange_strong(fed, now)) _with.feed(); // another thread has fed otherwise
 }
 
 } // namespace rolvane

@@ -13,15 +13,15 @@ namespace rolvane {
 // and is killed and started anew by the manager. Made and destroyed on the loop's thread.
 class Watchdog {
 public:
-    struct World {
+    struct Collaborators {
         std::function<void()> feed;  // tells the manager; any thread
         std::function<double()> now; // seconds of a clock that never goes back
     };
     // The limit that the manager has set for this process, in seconds; none where nobody watches.
     static std::optional<double> limitOfTheManager();
-    static World platform();
+    static Collaborators platform();
 
-    Watchdog(RunLoop& loop, double limit, World world);
+    Watchdog(RunLoop& loop, double limit, Collaborators with);
     Watchdog(const Watchdog&) = delete;
     Watchdog& operator=(const Watchdog&) = delete;
 
@@ -32,7 +32,7 @@ private:
 
     RunLoop& _loop;
     const double _pause;
-    const World _world;
+    const Collaborators _with;
     std::atomic<double> _fed;
     RunLoop::Handle _timer;
 };

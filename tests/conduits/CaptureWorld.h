@@ -43,8 +43,8 @@ public:
 
     std::unique_ptr<CXDCXConduit> makeConduit() {
         // Saves of this very process count as another's, because the tests are both sides.
-        return std::make_unique<CXDCXConduit>(
-            engine, CXDCXConduit::World{database, preferences, clock, center, /*processID*/ 1, "another program"});
+        return std::make_unique<CXDCXConduit>(engine, CXDCXConduit::Collaborators{database, preferences, clock, center,
+                                                                                  /*processID*/ 1, "another program"});
     }
 
     CXPersonRef person(const char* name, const char* uuid = nullptr) {

@@ -149,7 +149,8 @@ public:
                 Deviation::HasNoCompositeChange, Deviation::TakesOnlyTheNameOfANewGroup};
     }
     std::unique_ptr<CXDConduit> makeConduit() override {
-        return std::make_unique<CXDCXConduit>(engine, CXDCXConduit::World{database, preferences, clock, center});
+        return std::make_unique<CXDCXConduit>(engine,
+                                              CXDCXConduit::Collaborators{database, preferences, clock, center});
     }
     std::optional<Dictionary> contact(const std::string& uid) override {
         const auto record = std::dynamic_pointer_cast<CXPerson>(database.recordForUniqueId(UniqueId(uid)));
@@ -217,9 +218,9 @@ public:
                 Deviation::RefusesTheTreesNamesForGood};
     }
     std::unique_ptr<CXDConduit> makeConduit() override {
-        return std::make_unique<CXDVaultraConduit>(engine, CXDVaultraConduit::World{_client.manager, _network,
-                                                                                    preferences, clock, center,
-                                                                                    _distributed, _alert, database});
+        return std::make_unique<CXDVaultraConduit>(
+            engine, CXDVaultraConduit::Collaborators{_client.manager, _network, preferences, clock, center,
+                                                     _distributed, _alert, database});
     }
     std::optional<Dictionary> contact(const std::string& uid) override {
         return plist("People/" + CXACLManager::bucketNameForUID(UniqueId(uid)) + "/" + uid);
@@ -268,11 +269,11 @@ public:
     }
     std::unique_ptr<CXDConduit> makeConduit() override {
         return std::make_unique<CXDLocalConduit>(
-            engine, CXDLocalConduit::World{database, preferences, clock, UserName("alice"), root});
+            engine, CXDLocalConduit::Collaborators{database, preferences, clock, UserName("alice"), root});
     }
     std::unique_ptr<CXDConduit> makeUsualConduit() override {
         return std::make_unique<CXDLocalConduit>(
-            engine, CXDLocalConduit::World{database, preferences, clock, UserName("alice")});
+            engine, CXDLocalConduit::Collaborators{database, preferences, clock, UserName("alice")});
     }
     std::optional<Dictionary> contact(const std::string& uid) override { return plist("People/" + uid); }
     std::optional<Dictionary> groupInfo(const std::string& uid) override {

@@ -33,7 +33,7 @@ protected:
     }
     std::unique_ptr<CXDLocalConduit> make() {
         return std::make_unique<CXDLocalConduit>(
-            engine, CXDLocalConduit::World{database, preferences, clock, UserName("ada"), root});
+            engine, CXDLocalConduit::Collaborators{database, preferences, clock, UserName("ada"), root});
     }
     static CXDChangeRecordPtr record(int type, const char* person, const char* group, Value payload = {},
                                      const char* user = "<self>") {
@@ -81,10 +81,11 @@ TEST_F(LocalConduit, IsTheSharedFoldersSource) {
 }
 
 TEST_F(LocalConduit, IsMeantForTheFolderThatAllUsersShare) {
-    const CXDLocalConduit usual(engine, CXDLocalConduit::World{database, preferences, clock, UserName("ada")});
+    const CXDLocalConduit usual(engine, CXDLocalConduit::Collaborators{database, preferences, clock, UserName("ada")});
     EXPECT_EQ(usual.lockPath(), "/usr/share/rolvane/.lock");
     EXPECT_EQ(usual.baseLocationForUser(UserName("bob"))->absoluteString(), "file:/usr/share/rolvane/bob");
-    const CXDLocalConduit another(engine, CXDLocalConduit::World{database, preferences, clock, UserName("eve")});
+    const CXDLocalConduit another(engine,
+                                  CXDLocalConduit::Collaborators{database, preferences, clock, UserName("eve")});
     EXPECT_EQ(usual.defaultManager(), another.defaultManager()) << "one file manager serves the process";
     EXPECT_EQ(conduit->lockPath(), root + "/.lock");
 }

@@ -17,7 +17,8 @@ public:
         conduit = daemonsConduit();
     }
     std::unique_ptr<CXDCXConduit> daemonsConduit() {
-        return std::make_unique<CXDCXConduit>(engine, CXDCXConduit::World{database, preferences, clock, center});
+        return std::make_unique<CXDCXConduit>(engine,
+                                              CXDCXConduit::Collaborators{database, preferences, clock, center});
     }
     // Bob's all-contacts group leads to Bob, as in every subscribed database.
     void subscribeLabel() {

@@ -32,9 +32,9 @@ protected:
     StoreRights() {
         engine.account = UserName("alice");
         store.instead = [this](const HttpRequest& r) { return answer(r); };
-        conduit = std::make_unique<CXDVaultraConduit>(engine, CXDVaultraConduit::World{*store.manager, network,
-                                                                                       preferences, clock, center,
-                                                                                       distributed, alert, database});
+        conduit = std::make_unique<CXDVaultraConduit>(
+            engine, CXDVaultraConduit::Collaborators{*store.manager, network, preferences, clock, center, distributed,
+                                                     alert, database});
     }
     std::optional<HttpResponse> answer(const HttpRequest& r) {
         const bool bobs = r.url.encodedPath().starts_with("/dav/bob/");

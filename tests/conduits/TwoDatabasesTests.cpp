@@ -21,7 +21,7 @@ struct Side {
                     .runLoop = nullptr}),
           preferences(path + "/preferences-" + user + ".db"),
           conduit(std::make_unique<CXDCXConduit>(
-              engine, CXDCXConduit::World{database, preferences, clock, center, 1, "another program"})) {
+              engine, CXDCXConduit::Collaborators{database, preferences, clock, center, 1, "another program"})) {
         engine.account = UserName(user);
     }
     NotificationCenter center;

@@ -65,8 +65,8 @@ protected:
     void use(std::unique_ptr<Client> other) {
         conduit.reset();
         client = std::move(other);
-        CXDVaultraConduit::World parts{client->manager, network,     preferences, clock,
-                                       center,          distributed, alert,       database};
+        CXDVaultraConduit::Collaborators parts{client->manager, network,     preferences, clock,
+                                               center,          distributed, alert,       database};
         parts.makeACLManager = [this](const Url& base, const LocationOwner& owner) {
             auto manager = std::make_shared<CXACLManager>(base, owner);
             managers.push_back(manager);
@@ -599,8 +599,8 @@ TEST_F(VaultraConduit, ContactsAndStatesAreWrittenSecurelyMarkersNamesAndTheCloc
         return answerOf(request.method == "GET" ? 404 : 201);
     });
     CXDAVManager manager(account, wire);
-    CXDVaultraConduit plain(
-        engine, CXDVaultraConduit::World{manager, network, preferences, clock, center, distributed, alert, database});
+    CXDVaultraConduit plain(engine, CXDVaultraConduit::Collaborators{manager, network, preferences, clock, center,
+                                                                     distributed, alert, database});
     const auto requestsOf = [&](const CXDChangeRecordPtr& change) {
         asked.clear();
         EXPECT_TRUE(plain.applyChangeRecord(change));

@@ -55,8 +55,8 @@ private:
         ~Standing() override { --count; }
         int& count;
     };
-    NewsWatch::World world() {
-        NewsWatch::World w;
+    NewsWatch::Collaborators world() {
+        NewsWatch::Collaborators w;
         w.now = [this] { return now; };
         w.wakeAt = [this](std::optional<double> at) { wakeAt = at; };
         w.random = [] { return 0.5; };

@@ -13,7 +13,7 @@ namespace rolvane::test {
 namespace {
 
 struct WatchdogTest : testing::Test {
-    Watchdog::World world() {
+    Watchdog::Collaborators world() {
         return {[this] { ++fed; }, [this] { return now.load(); }};
     }
     RunLoop loop;

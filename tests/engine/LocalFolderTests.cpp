@@ -27,7 +27,7 @@ protected:
         whose.engine = std::make_unique<CXDSyncEngine>(parts);
         return std::make_unique<CXDLocalConduit>(
             *whose.engine,
-            CXDLocalConduit::World{*whose.rolvane, whose.preferences, whose.clock, UserName(login), folder});
+            CXDLocalConduit::Collaborators{*whose.rolvane, whose.preferences, whose.clock, UserName(login), folder});
     }
     bool isEmpty() const { return fs::is_empty(folder); }
 

@@ -207,11 +207,12 @@ public:
 
 private:
     EngineConduits conduits(ConduitEngine& owner) {
-        CXDVaultraConduit::World parts{manager, network, preferences, clock, center, distributed, alert, *database};
+        CXDVaultraConduit::Collaborators parts{manager, network,     preferences, clock,
+                                               center,  distributed, alert,       *database};
         parts.withdrawals = &notice;
         auto vaultra = std::make_unique<CXDVaultraConduit>(owner, std::move(parts));
         auto cx = std::make_unique<CXDCXConduit>(
-            owner, CXDCXConduit::World{*database, preferences, Clock::system(), center, /*processID*/ 1});
+            owner, CXDCXConduit::Collaborators{*database, preferences, Clock::system(), center, /*processID*/ 1});
         CXDVaultraConduit* store = vaultra.get();
         return {std::move(cx), std::move(vaultra), [store] { return store->vaultraOffLine(); }};
     }

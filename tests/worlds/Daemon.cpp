@@ -56,11 +56,12 @@ Daemon::Daemon(const Person& person, const Weather& weather, Report& report)
 }
 
 EngineConduits Daemon::conduits(ConduitEngine& owner) {
-    CXDVaultraConduit::World parts{_manager, _network, _preferences, _clock, _center, _distributed, _alert, *_database};
+    CXDVaultraConduit::Collaborators parts{_manager, _network,     _preferences, _clock,
+                                           _center,  _distributed, _alert,       *_database};
     parts.withdrawals = &_notice;
     auto vaultra = std::make_unique<CXDVaultraConduit>(owner, std::move(parts));
-    auto cx =
-        std::make_unique<CXDCXConduit>(owner, CXDCXConduit::World{*_database, _preferences, Clock::system(), _center});
+    auto cx = std::make_unique<CXDCXConduit>(
+        owner, CXDCXConduit::Collaborators{*_database, _preferences, Clock::system(), _center});
     CXDVaultraConduit* store = vaultra.get();
     return {std::move(cx), std::move(vaultra), [store] { return store->vaultraOffLine(); }};
 }

@@ -42,11 +42,11 @@ CXSearchElement groupsModifiedAfter(Date date) {
 
 } // namespace
 
-CXDCXConduit::CXDCXConduit(ConduitEngine& engine, World world) : CXDConduit(engine), _world(std::move(world)) {
+CXDCXConduit::CXDCXConduit(ConduitEngine& engine, Collaborators with) : CXDConduit(engine), _with(std::move(with)) {
     setKillSwitch();
     _databaseChanged =
-        _world.notifications.observe(kCXDatabaseChangedExternallyNotificationPriv,
-                                     [this](const Notification& notification) { rolvaneChanged(notification); });
+        _with.notifications.observe(kCXDatabaseChangedExternallyNotificationPriv,
+                                    [this](const Notification& notification) { rolvaneChanged(notification); });
 }
 
 CXDCXConduit::~CXDCXConduit() = default;
@@ -69,7 +69,7 @@ Dictionary CXDCXConduit::priorState() const {
 }
 
 const std::string& CXDCXConduit::ownProgram() const {
-    return _world.program.empty() ? rolvane().programName() : _world.program;
+    return _with.program.empty() ? rolvane().programName() : _with.program;
 }
 
 ChangeCapture CXDCXConduit::newCapture() const {
@@ -79,10 +79,10 @@ ChangeCapture CXDCXConduit::newCapture() const {
 // -- a pass
 
 void CXDCXConduit::open() {
-    _lastSyncDate = _world.preferences.get(kDaemonDomain, kLastSyncDateKey).date().value_or(Date::distantPast());
+    _lastSyncDate = _with.preferences.get(kDaemonDomain, kLastSyncDateKey).date().value_or(Date::distantPast());
     _scan.reset();
     _takesIn = false;
-    _isOneOfSeveral = isOneOfSeveral(_world.preferences);
+    _isOneOfSeveral = isOneOfSeveral(_with.preferences);
     _publishers.clear();
     // A trickle pass has gathered before it opens the conduits.
     const int64_t now = rolvane().journalPosition();
@@ -96,9 +96,9 @@ void CXDCXConduit::close() {
     _captured = 0;
     _written.clear();
     if (_takesIn) return; // the next scan looks behind the same date
-    _lastSyncDate = _world.clock.now();
-    _world.preferences.set(kDaemonDomain, kLastSyncDateKey, *_lastSyncDate);
-    _world.preferences.synchronize(kDaemonDomain);
+    _lastSyncDate = _with.clock.now();
+    _with.preferences.set(kDaemonDomain, kLastSyncDateKey, *_lastSyncDate);
+    _with.preferences.synchronize(kDaemonDomain);
     if (_scan) {
         rolvane().advanceCursorTo(_scan->journalPosition, _scan->since);
         _lastScan = _scan->journalPosition;
@@ -108,7 +108,7 @@ void CXDCXConduit::close() {
 
 CXDChangeRecords CXDCXConduit::changeRecords() {
     engine().checkCXShareCount();
-    _takesIn = isTakingIn(engine(), _world.preferences, rolvane());
+    _takesIn = isTakingIn(engine(), _with.preferences, rolvane());
     if (_takesIn) return {};
     const Date since = _lastSyncDate.value_or(Date::distantPast());
     const bool hasTakenIn = scansAfterTakingIn(engine());
@@ -254,9 +254,9 @@ void CXDCXConduit::addUnsettledPeople(ChangeCapture& capture) {
 
 void CXDCXConduit::rolvaneChanged(const Notification& notification) {
     engine().updateStateAndExitIfNeeded();
-    if (notification.userInfo[kCXSenderProcessID].integer() == _world.processID) return;
+    if (notification.userInfo[kCXSenderProcessID].integer() == _with.processID) return;
     engine().checkCXShareCount();
-    if (isTakingIn(engine(), _world.preferences, rolvane())) return engine().bringSourcesUpToDate(); // scanned later
+    if (isTakingIn(engine(), _with.preferences, rolvane())) return engine().bringSourcesUpToDate(); // scanned later
     _captured = rolvane().journalPosition();
 
     const Array inserted = notification.userInfo[kCXInsertedRecords].array();

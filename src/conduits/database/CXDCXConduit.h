@@ -41,7 +41,7 @@ public:
     static constexpr const char* kLastSyncDateKey = "CXDCXConduitLastSyncDate";
 
     // All borrowed; they outlive the conduit.
-    struct World {
+    struct Collaborators {
         CXRolvane& rolvane;
         Preferences& preferences;
         Clock& clock;
@@ -50,7 +50,7 @@ public:
         std::string program{};             // the same for earlier runs; "": the database's program name
     };
 
-    CXDCXConduit(ConduitEngine& engine, World world);
+    CXDCXConduit(ConduitEngine& engine, Collaborators with);
     ~CXDCXConduit() override;
 
     std::optional<std::string> conduitID() const override;
@@ -125,7 +125,7 @@ public:
     // Set once: nobody holds read-write access to the owner's own data, so a change to it from outside is bogus.
     void setKillSwitch();
     bool readOnlyKillSwitch() const { return _readOnlyKillSwitch; }
-    CXRolvane& rolvane() const { return _world.rolvane; }
+    CXRolvane& rolvane() const { return _with.rolvane; }
 
 private:
     // What a full scan of this pass has covered: saves up to the journal's position, modified after the date.
@@ -168,7 +168,7 @@ private:
     void captureDeleted(ChangeCapture& capture, const Array& identifiers);
     void captureWhatListed(ChangeCapture& capture, const RemovalChanges& removals, const UniqueId& uid);
 
-    World _world;
+    Collaborators _with;
     bool _readOnlyKillSwitch = false;
     bool _isOneOfSeveral = false; // other computers of the owner write to the tree; as of the last open
     bool _takesIn = false;        // this pass takes the owner's tree in, and has scanned nothing

@@ -362,7 +362,7 @@ void CXDCXConduit::changeOwnList(const CXDChangeRecord& record, const char* prop
         group->setValue(list, property);
     else if (group->valueForProperty(property))
         group->removeValueForProperty(property);
-    noteSharingDates(*group, property, differences, _world.clock.now());
+    noteSharingDates(*group, property, differences, _with.clock.now());
 }
 
 bool CXDCXConduit::changeGroupReadWriteACL(const CXDChangeRecordPtr& record) {

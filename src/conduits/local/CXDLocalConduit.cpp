@@ -43,8 +43,8 @@ Dictionary stateAfter(const Dictionary& before, const Dictionary& payload) {
 
 } // namespace
 
-CXDLocalConduit::CXDLocalConduit(ConduitEngine& engine, World world)
-    : CXDConduit(engine), _world(std::move(world)), _files(_world.root), _manager(managerFor(_world.root)) {}
+CXDLocalConduit::CXDLocalConduit(ConduitEngine& engine, Collaborators with)
+    : CXDConduit(engine), _with(std::move(with)), _files(_with.root), _manager(managerFor(_with.root)) {}
 
 CXDLocalConduit::~CXDLocalConduit() = default;
 
@@ -53,7 +53,7 @@ std::optional<std::string> CXDLocalConduit::conduitID() const {
 }
 
 std::optional<UserName> CXDLocalConduit::realUserFromUser(const std::optional<UserName>& user) const {
-    return user == kSelf ? _world.login : user;
+    return user == kSelf ? _with.login : user;
 }
 
 int32_t CXDLocalConduit::conduitSource() const {
@@ -66,23 +66,23 @@ CXFileManager* CXDLocalConduit::defaultManager() const {
 
 std::optional<Url> CXDLocalConduit::baseLocationForUser(const std::optional<UserName>& user) const {
     if (!user || !isAFileName(user->str())) return std::nullopt;
-    return Url::fileURL(_world.root).cxURLByAppendingComponent(user->str());
+    return Url::fileURL(_with.root).cxURLByAppendingComponent(user->str());
 }
 
 std::string CXDLocalConduit::lockPath() const {
-    return _world.root + "/" + std::string(kLockFile);
+    return _with.root + "/" + std::string(kLockFile);
 }
 
 void CXDLocalConduit::open() {
     engine().lockURL(Url::fileURL(lockPath())); // who does not get the lock reads all the same
-    _lastSyncDate = _world.preferences.get(kDaemonDomain, kLastSyncDateKey).date().value_or(Date::distantPast());
+    _lastSyncDate = _with.preferences.get(kDaemonDomain, kLastSyncDateKey).date().value_or(Date::distantPast());
 }
 
 void CXDLocalConduit::close() {
     CXDConduit::close();
-    _lastSyncDate = _world.clock.now();
-    _world.preferences.set(kDaemonDomain, kLastSyncDateKey, *_lastSyncDate);
-    _world.preferences.synchronize(kDaemonDomain);
+    _lastSyncDate = _with.clock.now();
+    _with.preferences.set(kDaemonDomain, kLastSyncDateKey, *_lastSyncDate);
+    _with.preferences.synchronize(kDaemonDomain);
 }
 
 // -- applying
@@ -109,7 +109,7 @@ std::optional<std::string> CXDLocalConduit::pathFor(const CXDChangeRecord& recor
                                                     std::initializer_list<std::string_view> below) const {
     const auto user = realUserFromUser(record.user());
     if (!user || !isAFileName(user->str())) return std::nullopt;
-    std::string path = _world.root + "/" + user->str();
+    std::string path = _with.root + "/" + user->str();
     for (const std::string_view name : below) {
         if (!isAFileName(name)) return std::nullopt;
         path += "/" + std::string(name);

@@ -30,7 +30,7 @@ public:
     static constexpr const char* kRoot = "/usr/share/rolvane";
 
     // References are borrowed and outlive the conduit.
-    struct World {
+    struct Collaborators {
         CXRolvane& rolvane;
         Preferences& preferences;
         Clock& clock;
@@ -38,7 +38,7 @@ public:
         std::string root = kRoot; // absolute; exists so that tests can have a folder of their own
     };
 
-    CXDLocalConduit(ConduitEngine& engine, World world);
+    CXDLocalConduit(ConduitEngine& engine, Collaborators with);
     ~CXDLocalConduit() override;
 
     std::optional<std::string> conduitID() const override;
@@ -63,8 +63,8 @@ public:
     bool publishAllGroup(const CXDChangeRecord& record);
 
 protected:
-    CXRolvane& database() const override { return _world.rolvane; }
-    Preferences& preferences() const override { return _world.preferences; }
+    CXRolvane& database() const override { return _with.rolvane; }
+    Preferences& preferences() const override { return _with.preferences; }
     bool keepsAccessLists() const override { return false; }
 
 private:
@@ -81,7 +81,7 @@ private:
     bool removeRecordFromGroup(CXDChangeRecord& record);
     bool deleteGroup(CXDChangeRecord& record);
 
-    World _world;
+    Collaborators _with;
     LocalFiles _files;
     std::shared_ptr<CXFileManager> _manager;
     std::vector<std::shared_ptr<CXSubscribedGroup>> _subscribedGroups; // kept for the form's sake; nothing uses it

@@ -20,12 +20,12 @@
 
 namespace rolvane {
 
-CXDVaultraConduit::CXDVaultraConduit(ConduitEngine& engine, World world)
-    : CXDConduit(engine), _world(std::move(world)) {
-    _simulated = _world.distributed.observe(
+CXDVaultraConduit::CXDVaultraConduit(ConduitEngine& engine, Collaborators with)
+    : CXDConduit(engine), _with(std::move(with)) {
+    _simulated = _with.distributed.observe(
         "SimulateVaultraNotification", [this](const Notification&) { vaultraSynced(); }, true);
-    _networkChanged = _world.notifications.observe(kCXNetworkConfigurationDidChangeNotification,
-                                                   [this](const Notification&) { networkChanged(); });
+    _networkChanged = _with.notifications.observe(kCXNetworkConfigurationDidChangeNotification,
+                                                  [this](const Notification&) { networkChanged(); });
 }
 
 CXDVaultraConduit::~CXDVaultraConduit() {
@@ -43,7 +43,7 @@ std::optional<std::string> CXDVaultraConduit::conduitID() const {
 }
 
 std::optional<UserName> CXDVaultraConduit::realUserFromUser(const std::optional<UserName>& user) const {
-    return user == kSelf ? _world.manager.account().user : user;
+    return user == kSelf ? _with.manager.account().user : user;
 }
 
 int32_t CXDVaultraConduit::conduitSource() const {
@@ -51,14 +51,14 @@ int32_t CXDVaultraConduit::conduitSource() const {
 }
 
 CXFileManager* CXDVaultraConduit::defaultManager() const {
-    return &_world.manager;
+    return &_with.manager;
 }
 
 std::optional<Url> CXDVaultraConduit::baseLocationForUser(const std::optional<UserName>& user) const {
     if (!user) return std::nullopt;
     const Lock guard(_basesLock);
     const auto [found, isNew] = _bases.try_emplace(*user);
-    if (isNew) found->second = _world.manager.account().baseLocationFor(*user);
+    if (isNew) found->second = _with.manager.account().baseLocationFor(*user);
     return found->second;
 }
 
@@ -70,12 +70,12 @@ std::optional<Url> CXDVaultraConduit::baseLocationOf(const CXDChangeRecord& reco
 
 int CXDVaultraConduit::testReachability(const std::function<void()>& meanwhile) {
     CXDAVError error;
-    const std::vector<std::string> origins = _world.manager.account().origins();
+    const std::vector<std::string> origins = _with.manager.account().origins();
     const std::string address = origins.empty() ? "" : Url(origins.front() + "/").host();
     // Without a route nobody is asked, so nobody can refuse the password either.
-    const bool routed = _world.network.canReachAddress(address);
+    const bool routed = _with.network.canReachAddress(address);
     if (!routed) error = {0, "There is no network."};
-    const bool online = routed && _world.manager.canReach(error, meanwhile);
+    const bool online = routed && _with.manager.canReach(error, meanwhile);
     _vaultraOffLine = !online;
     engine().storeWasTested(online, online ? 0 : error.code, online ? std::string() : error.reason);
     CXDLog("Vaultra is %@", online ? "online" : "offline");
@@ -84,15 +84,15 @@ int CXDVaultraConduit::testReachability(const std::function<void()>& meanwhile) 
 
 // The first requests of a gathering for a subscribed tree go along with the test of the store and the login.
 void CXDVaultraConduit::beginReading() {
-    for (const CXSubscriptionRef& subscription : _world.rolvane.subscriptions()) {
+    for (const CXSubscriptionRef& subscription : _with.rolvane.subscriptions()) {
         const RemoteLocation location = subscription->remoteLocation();
         if (syncSourceForRemoteLocation(location) != conduitSource()) continue;
         const UserName user = engine().userForRemoteLocation(location);
         const auto base = user.empty() || user == kSelf ? std::nullopt : baseLocationForUser(user);
         if (!base) continue;
         if (!_foundNothing.contains(user)) // else it is read when the tree has changed
-            _world.manager.expectSomeReads({base->cxURLByAppendingComponent(layout::kInfo)}, false);
-        _world.manager.expectListing(*base);
+            _with.manager.expectSomeReads({base->cxURLByAppendingComponent(layout::kInfo)}, false);
+        _with.manager.expectListing(*base);
         return; // a wrong password is not to be offered many times
     }
 }
@@ -101,7 +101,7 @@ void CXDVaultraConduit::beginReading() {
 // it: reading it, the lock and the writes meet what is missing.
 void CXDVaultraConduit::lookAfterStructure(bool meanwhile) {
     awaitStructure();
-    if (_world.manager.knowsPublishStructure()) return;
+    if (_with.manager.knowsPublishStructure()) return;
     if (!meanwhile) {
         sanityCheckPublishStructure();
         return;
@@ -125,8 +125,8 @@ void CXDVaultraConduit::open() {
     const bool gathering = std::exchange(_gathering, false);
     if (_serverDate.valid()) _serverDate.wait(); // of a pass that failed
     _serverDate = {};
-    _world.manager.expectNothing();
-    _world.manager.useVersionMemoryOf(database().databaseIdentity(), database().shareCount());
+    _with.manager.expectNothing();
+    _with.manager.useVersionMemoryOf(database().databaseIdentity(), database().shareCount());
     _writes.giveUpMerged(); // of a pass that failed
     _setBack.clear();
     _writtenInOrder.clear();
@@ -143,13 +143,13 @@ void CXDVaultraConduit::open() {
         }
         engine().cancel();
     }
-    _lastSyncDate = _world.preferences.get(kDaemonDomain, kLastSyncDateKey).date().value_or(Date::distantPast());
+    _lastSyncDate = _with.preferences.get(kDaemonDomain, kLastSyncDateKey).date().value_or(Date::distantPast());
     if (_vaultraOffLine) return;
     openAsOneOfSeveral();
     _isWrittenByOthers = somebodyMayWrite();
     forgetSubscribersRights();
     const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
-    _world.manager.keepSerialNumber(users[kSelf.str()].dictionary()[kSerialNumber].string());
+    _with.manager.keepSerialNumber(users[kSelf.str()].dictionary()[kSerialNumber].string());
     if (!_takesIn) lookAfterStructure(gathering && !users.contains(kSelf.str()));
 }
 
@@ -163,7 +163,7 @@ void CXDVaultraConduit::willClose() {
 void CXDVaultraConduit::close() {
     CXDConduit::close();
     awaitStructure();
-    _world.manager.expectNothing();
+    _with.manager.expectNothing();
     if (_vaultraOffLine) return;
     if (_takesIn) return closeTakingIn();
     if (isToBePublishedAgain()) return;
@@ -172,19 +172,19 @@ void CXDVaultraConduit::close() {
     CXDLog("Closing, last sync: %@", now);
     // A store that went away during the pass tells no date: keeping the old one costs reads, a guessed one loses edits.
     if (!now) return;
-    if (isLeftOut("date of the store")) now = _world.clock.now();
+    if (isLeftOut("date of the store")) now = _with.clock.now();
     _lastSyncDate = now;
-    _world.preferences.set(kDaemonDomain, kLastSyncDateKey, *now);
-    _world.preferences.synchronize(kDaemonDomain);
+    _with.preferences.set(kDaemonDomain, kLastSyncDateKey, *now);
+    _with.preferences.synchronize(kDaemonDomain);
 }
 
 void CXDVaultraConduit::passWasStored() {
     forgetWhatIsKnown();
-    if (!_vaultraOffLine) _world.manager.saveVersionMemory(database().databaseIdentity(), database().shareCount());
+    if (!_vaultraOffLine) _with.manager.saveVersionMemory(database().databaseIdentity(), database().shareCount());
 }
 
 void CXDVaultraConduit::passWasNotStored() {
-    _world.manager.revertVersionMemory();
+    _with.manager.revertVersionMemory();
 }
 
 std::optional<Date> CXDVaultraConduit::currentServerDate() {
@@ -192,17 +192,17 @@ std::optional<Date> CXDVaultraConduit::currentServerDate() {
     const auto base = baseLocationForUser(realUserFromUser(kSelf));
     if (!base) return std::nullopt;
     const Url dateFile = layout::dateFileLocation(*base);
-    _world.manager.write(std::string(layout::kClockText), dateFile, false);
-    return _world.manager.modDateForURL(dateFile);
+    _with.manager.write(std::string(layout::kClockText), dateFile, false);
+    return _with.manager.modDateForURL(dateFile);
 }
 
 bool CXDVaultraConduit::sanityCheckPublishStructure() {
-    return _world.manager.sanityCheckPublishStructureCreate(true);
+    return _with.manager.sanityCheckPublishStructureCreate(true);
 }
 
 void CXDVaultraConduit::networkChanged() {
     CXDLog("Network changed");
-    _world.manager.networkChanged();
+    _with.manager.networkChanged();
     testReachability();
     if (!_vaultraOffLine) engine().bringSourcesUpToDate();
 }
@@ -212,8 +212,8 @@ void CXDVaultraConduit::vaultraSynced() {
 }
 
 bool CXDVaultraConduit::shouldWarnUserAboutUserNameOrPassword() const {
-    const auto last = _world.preferences.get(kDaemonDomain, kLastWarningDateKey).date();
-    return !last || _world.clock.now().secondsSince(*last) > kWarningInterval;
+    const auto last = _with.preferences.get(kDaemonDomain, kLastWarningDateKey).date();
+    return !last || _with.clock.now().secondsSince(*last) > kWarningInterval;
 }
 
 void CXDVaultraConduit::warnUserAboutUserNameOrPassword() {
@@ -222,13 +222,13 @@ void CXDVaultraConduit::warnUserAboutUserNameOrPassword() {
     text.message = localizedText("SHARING_BAD_USERNAME_PASS");
     text.defaultButton = localizedText("OK");
     text.icon = "Rolvane";
-    _world.alert.show(text);
-    _world.preferences.set(kDaemonDomain, kLastWarningDateKey, _world.clock.now());
-    _world.preferences.synchronize(kDaemonDomain);
+    _with.alert.show(text);
+    _with.preferences.set(kDaemonDomain, kLastWarningDateKey, _with.clock.now());
+    _with.preferences.synchronize(kDaemonDomain);
 }
 
 Dictionary CXDVaultraConduit::currentState() {
-    const CXDAVManager::Snapshot unchangedGroupsAreNotFetched(_world.manager);
+    const CXDAVManager::Snapshot unchangedGroupsAreNotFetched(_with.manager);
     return CXDConduit::currentState();
 }
 

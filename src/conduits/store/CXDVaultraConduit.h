@@ -50,7 +50,7 @@ public:
     static constexpr bool kSecureRecordWrites = true; // contact records, group states and new groups' "info"
 
     // All borrowed; they outlive the conduit.
-    struct World {
+    struct Collaborators {
         CXDAVManager& manager;
         CXNetworkController& network;
         Preferences& preferences;
@@ -63,7 +63,7 @@ public:
         WithdrawalNotice* withdrawals = nullptr; // none: nothing is kept and nobody is told
     };
 
-    CXDVaultraConduit(ConduitEngine& engine, World world);
+    CXDVaultraConduit(ConduitEngine& engine, Collaborators with);
     ~CXDVaultraConduit() override;
 
     std::optional<std::string> conduitID() const override;
@@ -118,10 +118,10 @@ public:
     void warnUserAboutUserNameOrPassword();
 
 protected:
-    CXRolvane& database() const override { return _world.rolvane; }
-    Preferences& preferences() const override { return _world.preferences; }
+    CXRolvane& database() const override { return _with.rolvane; }
+    Preferences& preferences() const override { return _with.preferences; }
     bool keepsAccessLists() const override; // as the server announces it
-    WithdrawalNotice* withdrawalNotice() const override { return _world.withdrawals; }
+    WithdrawalNotice* withdrawalNotice() const override { return _with.withdrawals; }
     // Sends what waits for the lists, tells the person and leaves a note.
     void ownPublicationEnds(const Url& base, bool replaced) override;
     // A tree that was set back or has lost its lists says nothing about anybody's contacts, and is left alone. The
@@ -198,9 +198,9 @@ private:
     bool changeGroupReadACL(CXDChangeRecord& record);
     bool changeGroupReadWriteACL(CXDChangeRecord& record);
 
-    World _world;
-    ContactWrites _writes{_world.manager, _world.rolvane};
-    NewOnStore _newOnStore{_world.rolvane};
+    Collaborators _with;
+    ContactWrites _writes{_with.manager, _with.rolvane};
+    NewOnStore _newOnStore{_with.rolvane};
     std::unordered_set<UserName> _writtenInOrder; // in the trees that were asked about; constant while a pass writes
     std::unordered_set<UniqueId> _newRecords;     // in those trees, that no list is known to name; constant likewise
     std::unordered_set<UniqueId> _lookedFor;      // among those that had come, by the last gathering; main thread

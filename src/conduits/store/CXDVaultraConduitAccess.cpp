@@ -72,7 +72,7 @@ bool CXDVaultraConduit::changeGroupReadWriteACL(CXDChangeRecord& record) {
 
 bool CXDVaultraConduit::saveACLs() {
     awaitStructure();
-    const Dictionary unsaved = _world.preferences.get(kDaemonDomain, kUnsavedAccessListsKey).dictionary();
+    const Dictionary unsaved = _with.preferences.get(kDaemonDomain, kUnsavedAccessListsKey).dictionary();
     if (!_vaultraOffLine)
         for (const auto& [location, changes] : unsaved) // those of another account wait until it is back
             if (engine().userForRemoteLocation(RemoteLocation(location)) == kSelf)
@@ -83,7 +83,7 @@ bool CXDVaultraConduit::saveACLs() {
 }
 
 void CXDVaultraConduit::noteUnsavedAccessLists() {
-    const Dictionary before = _world.preferences.get(kDaemonDomain, kUnsavedAccessListsKey).dictionary();
+    const Dictionary before = _with.preferences.get(kDaemonDomain, kUnsavedAccessListsKey).dictionary();
     Dictionary now = before.mutableCopy();
     if (_ACLManagerMap)
         for (const auto& [location, manager] : *_ACLManagerMap) {
@@ -91,16 +91,16 @@ void CXDVaultraConduit::noteUnsavedAccessLists() {
             changes.empty() ? now.remove(location) : now.set(location, changes);
         }
     if (now == before) return;
-    _world.preferences.set(kDaemonDomain, kUnsavedAccessListsKey, now.empty() ? Value() : Value(now));
+    _with.preferences.set(kDaemonDomain, kUnsavedAccessListsKey, now.empty() ? Value() : Value(now));
     const auto own = baseLocationForUser(realUserFromUser(kSelf));
-    auto ended = endedPublication(_world.preferences);
+    auto ended = endedPublication(_with.preferences);
     if (!ended || ended->replaced || !own || now.contains(own->absoluteString())) return;
     ended->mayStillRead.clear();
-    noteEndedPublication(_world.preferences, *ended);
+    noteEndedPublication(_with.preferences, *ended);
 }
 
 bool CXDVaultraConduit::keepsAccessLists() const {
-    return _world.manager.keepsAccessLists().value_or(false);
+    return _with.manager.keepsAccessLists().value_or(false);
 }
 
 // Our rights on somebody else's tree may have changed since they were asked for; nothing of ours is lost with the
@@ -115,13 +115,13 @@ std::shared_ptr<CXACLManager> CXDVaultraConduit::ACLManagerForRemoteLocation(con
     const auto base = baseLocationForRemoteLocation(location);
     if (!base) return nullptr;
     std::shared_ptr<CXACLManager> manager;
-    if (_world.makeACLManager)
-        manager = _world.makeACLManager(*base, engine());
+    if (_with.makeACLManager)
+        manager = _with.makeACLManager(*base, engine());
     else
-        manager = std::make_shared<CXDAVACLManager>(*base, engine(), _world.manager);
+        manager = std::make_shared<CXDAVACLManager>(*base, engine(), _with.manager);
     if (manager->publisher())
         manager->resume(
-            _world.preferences.get(kDaemonDomain, kUnsavedAccessListsKey).dictionary()[base->absoluteString()].array());
+            _with.preferences.get(kDaemonDomain, kUnsavedAccessListsKey).dictionary()[base->absoluteString()].array());
     _ACLManagerMap->insert_or_assign(base->absoluteString(), manager);
     return manager;
 }
@@ -148,19 +148,19 @@ void CXDVaultraConduit::restoreAccessLists() {
 
 // Lists that another publication has are not this database's to change.
 void CXDVaultraConduit::ownPublicationEnds(const Url& base, bool replaced) {
-    if (!_world.rolvane.allGroup()->valueForProperty(kCXRemoteLocationProperty)) return; // by the owner's doing
+    if (!_with.rolvane.allGroup()->valueForProperty(kCXRemoteLocationProperty)) return; // by the owner's doing
     const Dictionary prior = engine().conduitObjectForKey(kConduitCX, kPriorState)[kSelf.str()].dictionary();
     const auto taken = [&](const char* property) {
-        const auto listed = _world.rolvane.allGroup()->multiValueForProperty(property);
+        const auto listed = _with.rolvane.allGroup()->multiValueForProperty(property);
         return takenAway(prior, property, listed ? listed->_allValues() : Array());
     };
     const Array readers = taken(kCXReadSharingACLProperty), writers = taken(kCXReadWriteSharingACLProperty);
-    const Dictionary unsaved = _world.preferences.get(kDaemonDomain, kUnsavedAccessListsKey).dictionary();
-    EndedPublication ended{_world.clock.now(), replaced, {}, _isOneOfSeveral};
+    const Dictionary unsaved = _with.preferences.get(kDaemonDomain, kUnsavedAccessListsKey).dictionary();
+    EndedPublication ended{_with.clock.now(), replaced, {}, _isOneOfSeveral};
     isOneOfSeveralNoMore();
     const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
     if (const Value& serial = users[kSelf.str()].dictionary()[kSerialNumber]; serial.isString() && !replaced)
-        _world.preferences.set(kDaemonDomain, kCXDFormerTree, serial);
+        _with.preferences.set(kDaemonDomain, kCXDFormerTree, serial);
     if (replaced) {
         const Array before = arrayOf(CXDAVACLManager::deniedIn(unsaved[base.absoluteString()].array()));
         for (const Value& name : cxArrayCombinedWithArray(before, cxArrayCombinedWithArray(readers, writers)))
@@ -176,8 +176,8 @@ void CXDVaultraConduit::ownPublicationEnds(const Url& base, bool replaced) {
     }
     CXLog("The publication has ended: %@.",
           replaced ? "another one lies in its place" : "the store forbids it, or has nothing of it any more");
-    noteEndedPublication(_world.preferences, ended);
-    _world.alert.tell(noticeOf(ended));
+    noteEndedPublication(_with.preferences, ended);
+    _with.alert.tell(noticeOf(ended));
 }
 
 } // namespace rolvane

@@ -68,13 +68,13 @@ void CXDVaultraConduit::wasRefused(const CXDChangeRecord& record) {
     const bool isEdit = record.type() == CXDUpdateRecord && record.initialSource() == CXDSyncSourceCX;
     if (isEdit && record.person() && !record.changeMadeByDataOwner()) forgetEdit(record);
     if (isContact && base && record.person())
-        _world.manager.forgetVersion(layout::contactLocation(*base, cxNormalizedUID(*record.person())));
+        _with.manager.forgetVersion(layout::contactLocation(*base, cxNormalizedUID(*record.person())));
 }
 
 // The store will never take this edit, so its version must not be merged with the edit.
 void CXDVaultraConduit::forgetEdit(const CXDChangeRecord& record) {
     const UniqueId uid = inDatabase(record);
-    if (const auto row = _world.rolvane.personRow(uid)) _world.rolvane.setCommonVersion(uid, row->encoded);
+    if (const auto row = _with.rolvane.personRow(uid)) _with.rolvane.setCommonVersion(uid, row->encoded);
 }
 
 // Identifiers also come out of other people's lists: one that names the tree's own files would destroy those. What has
@@ -162,7 +162,7 @@ bool CXDVaultraConduit::updateRecord(CXDChangeRecord& record, int& code) {
                                      _newOnStore.isNamedAlone(inDatabase(record))};
     if (_inDoubt.contains(place.uniqueId) || !_writes.write(place, contentOf(record), code)) return false;
     if (place.wasNeverThere || _newRecords.contains(place.uniqueId))
-        _newOnStore.wasPut(user, place.uniqueId, _world.clock.now());
+        _newOnStore.wasPut(user, place.uniqueId, _with.clock.now());
     return true;
 }
 
@@ -183,7 +183,7 @@ bool CXDVaultraConduit::mergesInto(const UserName& user) {
 CXDChangeRecords CXDVaultraConduit::takeMerged() {
     CXDChangeRecords updates;
     for (const ContactWrites::Merged& merged : _writes.takeMerged()) {
-        if (!_world.rolvane.personRow(merged.place.uniqueId)) continue; // deleted meanwhile, and so it stays
+        if (!_with.rolvane.personRow(merged.place.uniqueId)) continue; // deleted meanwhile, and so it stays
         Dictionary content = merged.contact.mutableCopy();
         const auto base = baseLocationForUser(realUserFromUser(merged.place.user));
         if (merged.place.user != kSelf && base)
@@ -199,7 +199,7 @@ CXDChangeRecords CXDVaultraConduit::takeMerged() {
 std::optional<Date> CXDVaultraConduit::dateOfContact(const CXDChangeRecord& record) {
     const auto base = baseLocationOf(record);
     if (_vaultraOffLine || !base || !record.person()) return std::nullopt;
-    return _world.manager.modDateForURL(layout::contactLocation(*base, cxNormalizedUID(*record.person())));
+    return _with.manager.modDateForURL(layout::contactLocation(*base, cxNormalizedUID(*record.person())));
 }
 
 bool CXDVaultraConduit::createStructureForGroup(CXDChangeRecord& record, int& code) {
@@ -209,11 +209,11 @@ bool CXDVaultraConduit::createStructureForGroup(CXDChangeRecord& record, int& co
     const UniqueId here = nameInDatabase(user, *record.group());
     if (_inDoubt.contains(here)) return false;
     // Whether the directory could be made shows in the write below it.
-    _world.manager.createDirectoryAtAURL(layout::groupLocation(*base, *record.group()));
+    _with.manager.createDirectoryAtAURL(layout::groupLocation(*base, *record.group()));
     const bool done =
-        _world.manager.write(stringForDictionary(contentOf(record)), layout::groupInfoLocation(*base, *record.group()),
-                             kSecureRecordWrites, &code);
-    if (done && _newRecords.contains(here)) _newOnStore.wasPut(user, here, _world.clock.now());
+        _with.manager.write(stringForDictionary(contentOf(record)), layout::groupInfoLocation(*base, *record.group()),
+                            kSecureRecordWrites, &code);
+    if (done && _newRecords.contains(here)) _newOnStore.wasPut(user, here, _with.clock.now());
     return done;
 }
 
@@ -234,9 +234,9 @@ bool CXDVaultraConduit::makeCompositeGroupChange(CXDChangeRecord& record, int& c
     };
     try {
         if (!waits(here) && std::none_of(named.begin(), named.end(), waits)) {
-            if (isList) _newOnStore.willName(*record.user(), named, _world.clock.now());
+            if (isList) _newOnStore.willName(*record.user(), named, _with.clock.now());
             if (writeComposite(record, payload, code)) {
-                if (_newRecords.contains(here)) _newOnStore.wasPut(*record.user(), here, _world.clock.now());
+                if (_newRecords.contains(here)) _newOnStore.wasPut(*record.user(), here, _with.clock.now());
                 return true;
             }
         }
@@ -252,7 +252,7 @@ bool CXDVaultraConduit::writeComposite(CXDChangeRecord& record, const Dictionary
     const auto base = baseLocationOf(record);
     if (!base || !record.group()) return false;
     const Url location = layout::groupLocation(*base, *record.group());
-    auto state = _world.manager.dictionaryAtURL(location, false, &code);
+    auto state = _with.manager.dictionaryAtURL(location, false, &code);
     if (!state && code == kMissing) {
         const bool isList = record.group()->str() == layout::kAllGroup;
         if (isList && !record.changeMadeByDataOwner()) return false; // it waits for its owner's
@@ -266,8 +266,8 @@ bool CXDVaultraConduit::writeComposite(CXDChangeRecord& record, const Dictionary
     // A state that is there and could not be read is not replaced by a part of it: the client then sends no write, and
     // the answer to the read stands.
     int written = 0;
-    const bool done = _world.manager.write(stringForDictionary(changed), location, kSecureRecordWrites, &written);
-    code = written != 0 ? written : cxAfterQuestion(_world.manager, *base, code);
+    const bool done = _with.manager.write(stringForDictionary(changed), location, kSecureRecordWrites, &written);
+    code = written != 0 ? written : cxAfterQuestion(_with.manager, *base, code);
     return done;
 }
 
@@ -289,7 +289,7 @@ bool CXDVaultraConduit::wasDeletedThere(CXDChangeRecord& record) {
     if (known.empty()) return false;
     int code = 0;
     const Url location = layout::groupLocation(*baseLocationOf(record), *record.group());
-    if (_world.manager.dictionaryAtURL(location, false, &code) || code != kMissing) return false;
+    if (_with.manager.dictionaryAtURL(location, false, &code) || code != kMissing) return false;
     if (record.group()->str() == layout::kAllGroup) return true; // it will be seen that the tree has lost its lists
     CXLog("The group has been deleted by somebody else, and is not changed any more: %@", record.description());
     engine().noteRefused({*record.user(), kRefusedAsGroupIsGone, known[kCXGroupNameProperty].string()});
@@ -312,28 +312,28 @@ Dictionary CXDVaultraConduit::lastKnownState(const CXDChangeRecord& record) {
 bool CXDVaultraConduit::changeGroupName(CXDChangeRecord& record, int& code) {
     const auto base = baseLocationOf(record);
     if (!base || !record.group()) return false;
-    return _world.manager.write(stringForDictionary(layout::infoAfterRename(record.payload())),
-                                layout::groupInfoLocation(*base, *record.group()), false, &code);
+    return _with.manager.write(stringForDictionary(layout::infoAfterRename(record.payload())),
+                               layout::groupInfoLocation(*base, *record.group()), false, &code);
 }
 
 bool CXDVaultraConduit::addRecordToGroup(CXDChangeRecord& record, int& code) {
     const auto base = baseLocationOf(record);
     if (!base || !record.group() || !record.person()) return false;
-    return _world.manager.write(std::string(layout::kMemberMarkerText),
-                                layout::memberMarkerLocation(*base, *record.group(), *record.person()), false, &code);
+    return _with.manager.write(std::string(layout::kMemberMarkerText),
+                               layout::memberMarkerLocation(*base, *record.group(), *record.person()), false, &code);
 }
 
 bool CXDVaultraConduit::deleteRecord(CXDChangeRecord& record, int& code) {
     const auto base = baseLocationOf(record);
     if (!base || !record.person() || _newOnStore.waitsForList(inDatabase(record))) return false;
-    return _world.manager.removeFileAtURL(layout::contactLocation(*base, *record.person()), &code);
+    return _with.manager.removeFileAtURL(layout::contactLocation(*base, *record.person()), &code);
 }
 
 bool CXDVaultraConduit::deleteGroup(CXDChangeRecord& record, int& code) {
     const auto base = baseLocationOf(record);
     if (!base || !record.group()) return false;
     if (_newOnStore.waitsForList(nameInDatabase(record.user().value_or(UserName()), *record.group()))) return false;
-    return _world.manager.removeFileAtURL(layout::groupLocation(*base, *record.group()), &code);
+    return _with.manager.removeFileAtURL(layout::groupLocation(*base, *record.group()), &code);
 }
 
 } // namespace rolvane

@@ -24,9 +24,9 @@ constexpr const char *kId = "id", *kSerial = "serial", *kDate = "date";
 } // namespace
 
 void CXDVaultraConduit::openAsOneOfSeveral() {
-    _isOneOfSeveral = isOneOfSeveral(_world.preferences);
-    _world.manager.mendOwnTreeOnly(_isOneOfSeveral);
-    _takesIn = _isOneOfSeveral && isTakingIn(engine(), _world.preferences, _world.rolvane);
+    _isOneOfSeveral = isOneOfSeveral(_with.preferences);
+    _with.manager.mendOwnTreeOnly(_isOneOfSeveral);
+    _takesIn = _isOneOfSeveral && isTakingIn(engine(), _with.preferences, _with.rolvane);
     _takenIn.reset();
     const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
     _ownTreeIsHeld = _isOneOfSeveral && (_takesIn || !hasTold(users[kSelf.str()].dictionary()[kSerialNumber]));
@@ -50,14 +50,14 @@ bool CXDVaultraConduit::takesIn(Dictionary prior, const Dictionary& state) {
 }
 
 bool CXDVaultraConduit::hasTold(const Value& serial) {
-    const Dictionary told = _world.preferences.get(kDaemonDomain, kCXDToldOfItself).dictionary();
-    return serial.isString() && told[kSerial] == serial && told[kId].string() == thisComputer(_world.preferences).id;
+    const Dictionary told = _with.preferences.get(kDaemonDomain, kCXDToldOfItself).dictionary();
+    return serial.isString() && told[kSerial] == serial && told[kId].string() == thisComputer(_with.preferences).id;
 }
 
 bool CXDVaultraConduit::isToTellAgain(const Value& serial) {
     if (!hasTold(serial)) return true;
-    const auto last = _world.preferences.get(kDaemonDomain, kCXDToldOfItself).dictionary()[kDate].date();
-    return !last || std::abs(_world.clock.now().secondsSince(*last)) >= kTellsEvery;
+    const auto last = _with.preferences.get(kDaemonDomain, kCXDToldOfItself).dictionary()[kDate].date();
+    return !last || std::abs(_with.clock.now().secondsSince(*last)) >= kTellsEvery;
 }
 
 // The file costs requests only where it is another one than at the last look, or has to be told that this computer is
@@ -67,32 +67,32 @@ bool CXDVaultraConduit::keepsInStepWithOthers(Dictionary prior, const Dictionary
     const Value& serial = state[kSerialNumber];
     const auto base = baseLocationForUser(realUserFromUser(kSelf));
     if (!base || (!version && !_isOneOfSeveral)) return true;
-    Computer self = thisComputer(_world.preferences);
+    Computer self = thisComputer(_with.preferences);
     // A copy of this memory on another machine has not looked yet.
     const Value look(self.id + " " + version.string());
     const bool tells = _isOneOfSeveral && isToTellAgain(serial);
     if (!tells && prior[ComputersOnStore::kFile] == look) return true;
-    ComputersOnStore onStore(_world.manager, *base);
+    ComputersOnStore onStore(_with.manager, *base);
     auto computers = onStore.read();
     if (!computers) return true;
     const auto isSelf = [&](const Computer& each) { return each.id == self.id; };
     if (tells || (_isOneOfSeveral && std::none_of(computers->begin(), computers->end(), isSelf))) {
-        self.seen = _world.clock.now();
+        self.seen = _with.clock.now();
         computers = onStore.put(self);
         if (!computers) return true; // what is held waits
-        _world.preferences.set(kDaemonDomain, kCXDToldOfItself,
-                               Dictionary{{kId, self.id}, {kSerial, serial}, {kDate, *self.seen}});
+        _with.preferences.set(kDaemonDomain, kCXDToldOfItself,
+                              Dictionary{{kId, self.id}, {kSerial, serial}, {kDate, *self.seen}});
         _ownTreeIsHeld = false;
     } else {
         prior.set(ComputersOnStore::kFile, look);
     }
-    _world.preferences.set(kDaemonDomain, kCXDComputers, valueOfComputers(*computers));
+    _with.preferences.set(kDaemonDomain, kCXDComputers, valueOfComputers(*computers));
     if (_isOneOfSeveral || std::all_of(computers->begin(), computers->end(), isSelf)) return true;
     CXLog("Another computer keeps this publication in step, too.");
-    becomeOneOfSeveral(_world.preferences);
+    becomeOneOfSeveral(_with.preferences);
     // This pass takes in nothing of the other one's, so it writes over nothing of it either.
     _isOneOfSeveral = _isWrittenByOthers = _ownTreeIsHeld = true;
-    _world.manager.mendOwnTreeOnly(true);
+    _with.manager.mendOwnTreeOnly(true);
     engine().bringSourcesUpToDate(); // after this pass
     return false;
 }
@@ -101,18 +101,18 @@ bool CXDVaultraConduit::keepsInStepWithOthers(Dictionary prior, const Dictionary
 void CXDVaultraConduit::closeTakingIn() {
     if (!_takenIn || engine().hasPendingChanges(kSelf, CXDSyncSourceCX)) return;
     endTakingIn(engine());
-    if (!_world.preferences.get(kDaemonDomain, kLastSyncDateKey)) {
+    if (!_with.preferences.get(kDaemonDomain, kLastSyncDateKey)) {
         _lastSyncDate = _takenIn;
-        _world.preferences.set(kDaemonDomain, kLastSyncDateKey, *_takenIn);
-        _world.preferences.synchronize(kDaemonDomain);
+        _with.preferences.set(kDaemonDomain, kLastSyncDateKey, *_takenIn);
+        _with.preferences.synchronize(kDaemonDomain);
     }
     CXLog("The tree of this account has been taken in.");
     engine().bringSourcesUpToDate(); // after this pass: now this computer's own contacts go
 }
 
 void CXDVaultraConduit::isOneOfSeveralNoMore() {
-    if (!isOneOfSeveral(_world.preferences)) return;
-    becomeTheOnlyOne(_world.preferences);
+    if (!isOneOfSeveral(_with.preferences)) return;
+    becomeTheOnlyOne(_with.preferences);
     forgetTakingIn(engine());
 }
 

@@ -57,7 +57,7 @@ bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state)
     if (isOwn && !isMended(prior, state)) return false;
     const Value knownSerial = prior[kSerialNumber], serial = state[kSerialNumber];
     if (!serial.isString() || (knownSerial.isString() && knownSerial != serial)) return true; // no tree, or another one
-    const IsHere isHere = [&](const UniqueId& name) { return _world.rolvane.recordForUniqueId(name) != nullptr; };
+    const IsHere isHere = [&](const UniqueId& name) { return _with.rolvane.recordForUniqueId(name) != nullptr; };
     const TreeCondition condition =
         isOwn ? treeCondition(prior, state, _lastSyncDate, isHere) : treeCondition(prior, state, std::nullopt);
     const Value looked = prior[kLookAgain];
@@ -99,11 +99,11 @@ bool CXDVaultraConduit::isBeingMended() {
 std::optional<CXDVaultraConduit::Comparison> CXDVaultraConduit::comparisonWith(const UserName& user, const Url& base,
                                                                                bool ask) {
     const auto states = engine().stateGeneration();
-    if (!states || !_world.rolvane.reached().empty() ||
+    if (!states || !_with.rolvane.reached().empty() ||
         (user == kSelf && (isBeingMended() || !engine().conduitObjectForKey(kConduitCX, kPublishAgain).empty())))
         return std::nullopt;
-    const auto tree = _world.manager.markOfTree(base, ask);
-    return tree ? std::optional(Comparison{_world.rolvane.journalPosition(), *states, *tree}) : std::nullopt;
+    const auto tree = _with.manager.markOfTree(base, ask);
+    return tree ? std::optional(Comparison{_with.rolvane.journalPosition(), *states, *tree}) : std::nullopt;
 }
 
 std::optional<Dictionary> CXDVaultraConduit::contactsChangedAlone(const UserName& user, const Url& base) {
@@ -114,13 +114,13 @@ std::optional<Dictionary> CXDVaultraConduit::contactsChangedAlone(const UserName
     if (user == kSelf && (_takesIn || (_isOneOfSeveral && isToTellAgain((*known)[kSerialNumber])))) return std::nullopt;
     const auto now = comparisonWith(user, base, true);
     if (!now || now->states != before->second.states ||
-        !areEditsOfPeopleAlone(_world.rolvane, before->second.journal, now->journal))
+        !areEditsOfPeopleAlone(_with.rolvane, before->second.journal, now->journal))
         return std::nullopt;
     std::optional<Dictionary> contacts = contactsChangedSince(user, base, before->second);
     if (!contacts) return std::nullopt;
     Dictionary prior = *known;
     Dictionary dates;
-    for (const auto& [file, date] : _world.manager.datesOfTree(base)) dates.set(file, date);
+    for (const auto& [file, date] : _with.manager.datesOfTree(base)) dates.set(file, date);
     if (!treeCondition({{kTreeDates, prior[kTreeDates].dictionary()}}, {{kTreeDates, dates}},
                        user == kSelf ? _lastSyncDate : std::nullopt)
              .isSound())
@@ -134,13 +134,13 @@ std::optional<Dictionary> CXDVaultraConduit::contactsChangedAlone(const UserName
 // Contacts that the database does not have are a matter of the lists that name them.
 std::optional<Dictionary> CXDVaultraConduit::contactsChangedSince(const UserName& user, const Url& base,
                                                                   const Comparison& before) {
-    const auto files = _world.manager.contactsChangedSince(base, before.tree);
+    const auto files = _with.manager.contactsChangedSince(base, before.tree);
     if (!files) return std::nullopt;
     Dictionary contacts;
     for (const auto& [path, file] : *files) {
         const UniqueId name(file.displayName);
         if (!name.endsWith(kCXPersonTable) || !layout::isASoundName(name.str()) || !file.modificationdate ||
-            file.size > layout::kLargestFile || !_world.rolvane.recordForUniqueId(nameInDatabase(user, name)))
+            file.size > layout::kLargestFile || !_with.rolvane.recordForUniqueId(nameInDatabase(user, name)))
             return std::nullopt;
         contacts.set(name.str(), Dictionary{{kModificationDate, *file.modificationdate}});
     }
@@ -168,7 +168,7 @@ void CXDVaultraConduit::mendOwnTree(const Dictionary& prior, const Dictionary& s
     if (_isWrittenByOthers) takeNamesAloneOut(prior, state);
     size_t written = 0;
     for (const UniqueId& name : contactsThatAreMissing(state)) {
-        const CXRecordRef person = _world.rolvane.recordForUniqueId(cxUIDWithTableName(name, kCXPersonTable));
+        const CXRecordRef person = _with.rolvane.recordForUniqueId(cxUIDWithTableName(name, kCXPersonTable));
         if (!person) continue;
         auto update = std::make_shared<CXDChangeRecord>(CXDSyncSourceCX, CXDUpdateRecord, kSelf, person->uniqueId(),
                                                         std::nullopt, person->dictionaryRepresentation());
@@ -183,7 +183,7 @@ void CXDVaultraConduit::mendOwnTree(const Dictionary& prior, const Dictionary& s
 // The writer of another one may still list it, so it is given its time.
 void CXDVaultraConduit::takeUnlistedAway(Dictionary prior, const Dictionary& state) {
     _leftovers = removalOfUnlisted(prior, state);
-    const Date now = _world.clock.now();
+    const Date now = _with.clock.now();
     Dictionary noted = prior[kUnlistedContacts].dictionary().mutableCopy();
     for (const CXDChangeRecordPtr& removal : _leftovers)
         if (removal->type() == CXDDeleteRecord) noted.set(removal->person()->str(), now.addingSeconds(-kPatience));
@@ -191,7 +191,7 @@ void CXDVaultraConduit::takeUnlistedAway(Dictionary prior, const Dictionary& sta
     for (const std::string& name : noted.allKeys()) known.emplace_back(name);
     Dictionary still;
     for (const UniqueId& name : contactsThatAreUnlisted(state, known)) {
-        if (_world.rolvane.recordForUniqueId(cxUIDWithTableName(name, kCXPersonTable))) continue; // to be listed
+        if (_with.rolvane.recordForUniqueId(cxUIDWithTableName(name, kCXPersonTable))) continue; // to be listed
         const Date since = noted[name.str()].date().value_or(now);
         still.set(name.str(), since);
         if (now.secondsSince(since) < kPatience) continue;
@@ -209,15 +209,15 @@ void CXDVaultraConduit::takeUnlistedAway(Dictionary prior, const Dictionary& sta
 // Groups that name a contact or a group which is nowhere, or a group that the owner's database cannot take in.
 void CXDVaultraConduit::takeNamesAloneOut(Dictionary prior, const Dictionary& state) {
     const Dictionary alone = namesAlone(
-        prior, state, [&](const UniqueId& name) { return _world.rolvane.recordForUniqueId(name) != nullptr; });
+        prior, state, [&](const UniqueId& name) { return _with.rolvane.recordForUniqueId(name) != nullptr; });
     const Dictionary circles = closingCircles(state, [&](const UniqueId& name) {
         std::vector<UniqueId> inner;
-        if (const auto group = std::dynamic_pointer_cast<CXGroup>(_world.rolvane.recordForUniqueId(name)))
+        if (const auto group = std::dynamic_pointer_cast<CXGroup>(_with.rolvane.recordForUniqueId(name)))
             inner = group->subgroupUniqueIds();
         for (UniqueId& each : inner) each = cxUIDWithTableName(each, kCXGroupTable);
         return inner;
     });
-    const Date now = _world.clock.now();
+    const Date now = _with.clock.now();
     const CXDChangeRecords removals = removalOfNamesAlone(prior, alone, circles, now);
     _leftovers.insert(_leftovers.end(), removals.begin(), removals.end());
     const Dictionary before = prior[kNamesAlone].dictionary();
@@ -245,16 +245,16 @@ bool CXDVaultraConduit::somebodyMayWrite() {
 
 // Empty lists stay where somebody was or something stood once.
 bool CXDVaultraConduit::allGroupHas(const char* property) {
-    const auto entries = _world.rolvane.allGroup()->multiValueForProperty(property);
+    const auto entries = _with.rolvane.allGroup()->multiValueForProperty(property);
     return entries && !entries->empty();
 }
 
 CXDChangeRecords CXDVaultraConduit::changeRecords() {
-    const int64_t journal = _world.rolvane.journalPosition(); // of before: what is saved meanwhile counts as unseen
-    if (_takesIn) beginTakingIn(engine(), _world.rolvane);
+    const int64_t journal = _with.rolvane.journalPosition(); // of before: what is saved meanwhile counts as unseen
+    if (_takesIn) beginTakingIn(engine(), _with.rolvane);
     CXDChangeRecords records = CXDConduit::changeRecords();
-    if (_world.rolvane.allGroup()->valueForProperty(kCXRemoteLocationProperty) && endedPublication(_world.preferences))
-        _world.preferences.remove(kDaemonDomain, kCXDEndedPublication); // published again since
+    if (_with.rolvane.allGroup()->valueForProperty(kCXRemoteLocationProperty) && endedPublication(_with.preferences))
+        _with.preferences.remove(kDaemonDomain, kCXDEndedPublication); // published again since
     _isOlderCopy = engine().conduitObjectForKey(kConduitCX, kPublishAgain)[kOlderCopy].boolean();
     std::set<UserName> changed;
     for (const CXDChangeRecordPtr& record : records)
@@ -280,12 +280,12 @@ CXDChangeRecords CXDVaultraConduit::changeRecords() {
 // Groups that were deleted, here or there, before the list of everybody named them.
 void CXDVaultraConduit::compareUnlistedGroups(CXDChangeRecords& records) {
     const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
-    AbsenceCheck absences(_world.rolvane);
+    AbsenceCheck absences(_with.rolvane);
     for (const auto& [user, state] : _read) {
         const Dictionary prior = users[user.str()].dictionary();
         const auto isHere = [&, &user = user](const UniqueId& group) {
             const UniqueId uid = nameInDatabase(user, group);
-            if (_world.rolvane.recordForUniqueId(uid)) return true;
+            if (_with.rolvane.recordForUniqueId(uid)) return true;
             absences.requireGone(uid);
             return false;
         };
@@ -369,11 +369,11 @@ void CXDVaultraConduit::nameAgain(CXDChangeRecords& records) {
 bool CXDVaultraConduit::wasNeverThere(const UserName& user, const UniqueId& name) {
     if (!mergesInto(user)) return false;
     const UniqueId here = nameInDatabase(user, name);
-    const CXRecordRef record = _world.rolvane.recordForUniqueId(here);
+    const CXRecordRef record = _with.rolvane.recordForUniqueId(here);
     if (!record) return false;
-    const auto isOver = [&](const Date& since) { return _world.clock.now().secondsSince(since) >= kPatience; };
+    const auto isOver = [&](const Date& since) { return _with.clock.now().secondsSince(since) >= kPatience; };
     if (!name.endsWith(kCXGroupTable)) {
-        const std::vector<CXReached> noted = _world.rolvane.reached();
+        const std::vector<CXReached> noted = _with.rolvane.reached();
         return std::any_of(noted.begin(), noted.end(), [&](const CXReached& each) {
             return each.uniqueId == here && each.tree == user && !each.hasFile && isOver(each.since);
         });
@@ -386,19 +386,19 @@ bool CXDVaultraConduit::wasNeverThere(const UserName& user, const UniqueId& name
 
 // Without those that the states know by now, and those that a leftover's time is over for.
 std::vector<CXReached> CXDVaultraConduit::whatHadCome() {
-    std::vector<CXReached> reached = _world.rolvane.reached();
+    std::vector<CXReached> reached = _with.rolvane.reached();
     if (reached.empty()) return reached;
     const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
     std::map<UserName, ListedRecords> known;
     std::erase_if(reached, [&](const CXReached& each) {
-        return !each.hasFile || _world.clock.now().secondsSince(each.since) >= kPatience ||
+        return !each.hasFile || _with.clock.now().secondsSince(each.since) >= kPatience ||
                known.try_emplace(each.tree, users[each.tree.str()].dictionary()).first->second.contains(each.uniqueId);
     });
     return reached;
 }
 
 void CXDVaultraConduit::forgetWhatIsKnown() {
-    const std::vector<CXReached> reached = _world.rolvane.reached();
+    const std::vector<CXReached> reached = _with.rolvane.reached();
     if (reached.empty()) return;
     std::unordered_set<UniqueId> unknown;
     for (const CXReached& each : whatHadCome()) unknown.insert(each.uniqueId);
@@ -412,7 +412,7 @@ void CXDVaultraConduit::forgetWhatIsKnown() {
 void CXDVaultraConduit::forgetWhatHasAFile() {
     if (isLeftOut("files that came")) return;
     std::vector<UniqueId> needless;
-    for (const CXReached& each : _world.rolvane.reached())
+    for (const CXReached& each : _with.rolvane.reached())
         if (const auto read = _read.find(each.tree); !each.hasFile && read != _read.end())
             if (read->second[kPeopleState].dictionary()[kMemberUIDState].dictionary().contains(
                     cxNormalizedUID(each.uniqueId).str()))
@@ -422,7 +422,7 @@ void CXDVaultraConduit::forgetWhatHasAFile() {
 
 void CXDVaultraConduit::forgetReached(const std::vector<UniqueId>& records) {
     try {
-        _world.rolvane.forgetReached(records);
+        _with.rolvane.forgetReached(records);
     } catch (const CXException& exception) {
         CXLog("Notes of new records are kept until the next pass: %@", exception);
     }
@@ -448,7 +448,7 @@ void CXDVaultraConduit::leaveUnlistedOut(CXDChangeRecords& records) {
         const UniqueId shared = cxNormalizedUID(*record->person());
         if (lists.try_emplace(*record->user(), read->second, kMemberUIDState).first->second.contains(shared))
             return false;
-        if (_world.rolvane.recordForUniqueId(*record->person())) return false;
+        if (_with.rolvane.recordForUniqueId(*record->person())) return false;
         CXDLog("Not listed, and left out: %@", record);
         if (record->user() == kSelf && _isWrittenByOthers) noteUnlisted(shared);
         return true;
@@ -460,7 +460,7 @@ void CXDVaultraConduit::noteUnlisted(const UniqueId& name) {
     const Dictionary* prior = users[kSelf.str()].dictionaryIf();
     if (!prior) return;
     Dictionary noted = Dictionary(*prior).dictionaryFor(kUnlistedContacts);
-    if (!noted.contains(name.str())) noted.set(name.str(), _world.clock.now());
+    if (!noted.contains(name.str())) noted.set(name.str(), _with.clock.now());
 }
 
 bool CXDVaultraConduit::findsAgain(const CXDChangeRecord& record) const {
