@@ -246,8 +246,9 @@ TEST_F(TakenBackPass, ANewGroupKeepsTheNameThatSomebodyElseGivesBehindIt) {
     bob.pass();
     const auto nameThere = [&] { return contentOf(world->file(crew->uniqueId().str()))[kCXGroupNameProperty]; };
     ASSERT_EQ(nameThere(), Value("Bob's")) << log.text();
-    passThatIsTakenBack(alice, kAtTheEnd);
+    passThatIsTakenBack(alice, crew->uniqueId().str().substr(0, 36));
     EXPECT_EQ(nameThere(), Value("Bob's")) << log.text();
+    ASSERT_EQ(crew->name(), "Crew") << log.text();
     settle();
     EXPECT_EQ(crew->name(), "Bob's") << log.text();
 }
