@@ -45,23 +45,6 @@ bool isContainer(const Value& value) {
     return value.isArray() || value.isDictionary();
 }
 
-// The same for two dictionaries of dictionaries, which ContentMark leaves out: they were compared and found equal, and
-// neither of them has changed since, nor has any dictionary in them. A dictionary takes part in one finding at a time.
-struct FoundEqual : SharedObject {
-    FoundEqual(const SharedObject* a, const SharedObject* b) : one(a), other(b) {}
-    bool isOf(const SharedObject* a, const SharedObject* b) const {
-        return !isOver.load(std::memory_order_relaxed) && ((a == one && b == other) || (a == other && b == one));
-    }
-    const SharedObject* const one;
-    const SharedObject* const other;
-    std::atomic<bool> isOver{false};
-
-    static std::mutex& turns() { // of the dictionaries that take part: readers on several threads may compare at once
-        static std::mutex one;
-        return one;
-    }
-};
-
 } // namespace
 
 // An open-addressed table from a string's hash to the places of the strings that have it. It holds no text: whoever
@@ -201,40 +184,6 @@ struct Array::Storage : SharedObject {
 struct Dictionary::Storage : SharedObject {
     Map map;
     ContentMark mark;
-    SharedPointer<FoundEqual> found;
-
-    void changes() {
-        mark.forget();
-        if (found) found->isOver.store(true, std::memory_order_relaxed);
-    }
-    static constexpr size_t kMany = 8; // from so many dictionaries on a finding is worth its while
-
-    bool wasFoundEqualTo(const Storage& other) const {
-        if (map.size() < kMany) return false;
-        const std::lock_guard turn(FoundEqual::turns());
-        return found && found == other.found && found->isOf(this, &other);
-    }
-    bool isOfManyPlainDictionaries() const {
-        return map.size() >= kMany && std::all_of(map.begin(), map.end(), [](const auto& entry) {
-                   const Dictionary* inner = entry.second.dictionaryIf();
-                   return inner && std::none_of(inner->begin(), inner->end(),
-                                                [](const auto& each) { return isContainer(each.second); });
-               });
-    }
-    void takePartIn(const SharedPointer<FoundEqual>& finding) {
-        if (found == finding) return;
-        if (found) found->isOver.store(true, std::memory_order_relaxed);
-        found = finding;
-    }
-    static void noteEqual(Storage& a, Storage& b) {
-        if (!a.isOfManyPlainDictionaries()) return;
-        const SharedPointer<FoundEqual> finding(new FoundEqual(&a, &b));
-        const std::lock_guard turn(FoundEqual::turns());
-        for (Storage* each : {&a, &b}) {
-            each->takePartIn(finding);
-            for (const auto& [key, inner] : each->map) inner.dictionaryIf()->_p->takePartIn(finding);
-        }
-    }
 };
 
 Array::Array() : _p(new Storage) {}
@@ -389,7 +338,7 @@ void Dictionary::set(std::string_view key, Value v) {
     if (v.isAbsent())
         throw CXException(kCXInvalidArgumentException,
                           fmt::format("an absent value cannot be stored in a dictionary (key \"{}\")", key));
-    _p->changes();
+    _p->mark.forget();
     if (auto it = _p->map.find(key); it != _p->map.end())
         it->second = std::move(v);
     else
@@ -400,14 +349,14 @@ bool Dictionary::setIfNew(std::string&& key, Value v) {
     if (v.isAbsent())
         throw CXException(kCXInvalidArgumentException,
                           fmt::format("an absent value cannot be stored in a dictionary (key \"{}\")", key));
-    _p->changes();
+    _p->mark.forget();
     const size_t before = _p->map.size();
     _p->map.try_emplace(_p->map.end(), std::move(key), std::move(v)); // the hint makes ascending keys cheap
     return _p->map.size() != before;
 }
 
 void Dictionary::remove(std::string_view key) {
-    _p->changes();
+    _p->mark.forget();
     if (auto it = _p->map.find(key); it != _p->map.end()) _p->map.erase(it);
 }
 
@@ -446,10 +395,7 @@ Dictionary Dictionary::mutableCopy() const {
 }
 
 bool operator==(const Dictionary& a, const Dictionary& b) {
-    if (a._p == b._p || a._p->mark.isThatOf(b._p->mark) || a._p->wasFoundEqualTo(*b._p)) return true;
-    if (a._p->map != b._p->map) return false;
-    Dictionary::Storage::noteEqual(*a._p, *b._p);
-    return true;
+    return a._p == b._p || a._p->mark.isThatOf(b._p->mark) || a._p->map == b._p->map;
 }
 
 bool Value::boolean(bool otherwise) const {
