@@ -127,8 +127,10 @@ CXDChangeRecords CXDCXConduit::changeRecords() {
     std::unordered_set<UniqueId> groups;
     for (const CXSearchElement& modified :
          {groupsModifiedAfter<CXGroup>(ownSince), groupsModifiedAfter<CXSubscribedGroup>(since)})
-        for (const CXRecordRef& group : rolvane().recordsMatchingSearchElement(modified)) {
-            capture.addGroup(std::dynamic_pointer_cast<CXGroup>(group));
+        for (const CXRecordRef& record : rolvane().recordsMatchingSearchElement(modified)) {
+            const auto group = std::dynamic_pointer_cast<CXGroup>(record);
+            if (!group) continue; // found by a damaged index
+            capture.addGroup(group);
             groups.insert(group->uniqueId());
         }
     if (!isLeftOut("groups of the journal")) addGroupsOfTheJournal(capture, scan, std::move(groups));

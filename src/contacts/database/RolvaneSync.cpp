@@ -234,6 +234,7 @@ void CXRolvane::Impl::advanceCursor(const Scanned& scan) {
 std::vector<UniqueId> CXRolvane::changedByOthers(int64_t after, int64_t until) {
     std::lock_guard lock(_impl->mutex);
     std::vector<UniqueId> changed;
+    if (until <= after) return changed;
     for (const CXJournalEntry& entry : _impl->journal.foreignEntries(after, until, _impl->options.program))
         changed.push_back(entry.uniqueId);
     return changed;
