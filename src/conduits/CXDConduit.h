@@ -139,9 +139,9 @@ protected:
     virtual WithdrawalNotice* withdrawalNotice() const; // base: none; nothing is kept and nobody is told
     // Whether the state that was just read of a user's store is to be believed. Base: always.
     virtual bool isTrusted(const UserName& user, const Dictionary& state);
-    // What the tree holds other than when a comparison with it found nothing, where that is contacts alone and nothing
-    // else that a comparison looks at has changed: contact -> {"modificationdate"}, as in a per-user state. None is
-    // made then. Nothing: the tree is to be compared. Base: nothing.
+    // The contacts whose files have changed since a comparison with the tree found nothing, where nothing else that a
+    // comparison looks at has changed: contact -> {"modificationdate"}, as in a per-user state. None is made then.
+    // Nothing: the tree is to be compared. Base: nothing.
     virtual std::optional<Dictionary> contactsChangedAlone(const UserName& /*user*/, const Url& /*base*/) {
         return std::nullopt;
     }

@@ -30,7 +30,7 @@ void note(ConduitEngine& engine, const char* text) {
 bool isTakingIn(ConduitEngine& engine, const Preferences& preferences, CXRolvane& database) {
     if (!isOneOfSeveral(preferences) || !database.allGroup()->valueForProperty(kCXRemoteLocationProperty)) return false;
     if (noteOf(engine) == kReads) return true;
-    // Whoever has published the tree knows what was written there, before the tree was ever read.
+    // The computer that has published the tree knows what was written there, before the tree was ever read.
     const Dictionary users = engine.conduitObjectForKey(kConduitVaultra, kPriorState);
     const Dictionary known = users[kSelf.str()].dictionary();
     return !known[kSerialNumber].isString() && known[std::string(layout::kAllGroup)].dictionary().empty();

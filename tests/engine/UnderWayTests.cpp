@@ -198,7 +198,8 @@ TEST_F(LeftUnsettled, APassThatCouldNotReadTheQueueKeepsTheNote) {
     const Value note = Dictionary{{"people", Array{kPerson}}};
     world.preferences.set(kDaemonDomain, kCXDUnderWay, note);
     world.cx->whenOpening = [] { throw CXException("TestException", "cannot be opened"); };
-    pass({own(CXDUpdateRecord, "Q:CXPerson", nullptr)});
+    pass({own(CXDUpdateRecord, "Q:CXPerson", nullptr),
+          makeRecord(CXDChangeGroupName, nullptr, kGroup, {CXDSyncSourceCX, CXDSyncSourceVaultra, "bob"}, "Name")});
     EXPECT_EQ(world.stored(kCXDUnderWay), note);
 }
 

@@ -111,7 +111,7 @@ Dictionary PassRecovery::mayHaveArrived(const CXDChangeRecords& left) const {
         return record->user() != kSelf && record->type() != CXDUpdateRecord;
     });
     const Dictionary waits = withSubscriptions(underWay(ofGroups));
-    const Dictionary all = isLeftOut("names before") ? waits : withNamesBefore(waits, *_underWay);
+    const Dictionary all = isLeftOut("names before") ? waits : withNamesBefore(waits, _underWay.value_or(Dictionary()));
     Dictionary subscribed;
     for (const auto& [user, of] : all)
         if (of.dictionary().contains(kSubscription)) subscribed.set(user, of);

@@ -153,7 +153,7 @@ public:
     // `ask`: the store is asked what has changed; the next listing of the tree in this pass is then made of that. None
     // where the store does not tell, or the tree was not listed yet.
     std::optional<TreeMark> markOfTree(const Url& tree, bool ask);
-    // What of the contact files would stand differently in a listing than in one at that mark, after the store was
+    // The contact files that would stand differently in a listing than in one at that mark, after the store was
     // asked for the present mark. Nothing where anything else of the tree may be different, too.
     std::optional<FileListing> contactsChangedSince(const Url& tree, const TreeMark& mark);
     // The dates of the tree's own files ("info", "dateFile"), as of the last listing.
