@@ -140,6 +140,8 @@ void TwoPeople::expectEqual(const std::map<std::string, std::string>& expected,
     EXPECT_EQ(found.size(), expected.size()) << what;
     for (const auto& [name, value] : expected)
         EXPECT_EQ(found.contains(name) ? found.at(name) : "nothing", value) << what << ", " << name;
+    for (const auto& [name, value] : found)
+        EXPECT_TRUE(expected.contains(name)) << what << ", " << name << ": " << value;
 }
 
 void TwoPeople::expectEverySurvivingNameWasWritten(CXRolvane& database) const {

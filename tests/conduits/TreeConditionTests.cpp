@@ -232,6 +232,16 @@ TEST(TreeCondition, ANameIsNowhereWhereNeitherAFileNorAListHasIt) {
     EXPECT_TRUE(namesThatAreNowhere(state, asked).empty()) << "no list, no judgement";
 }
 
+TEST(TreeCondition, AContactThatIsKnownByGroupsAloneHasLeftOne) {
+    Dictionary prior = tree(), now = tree();
+    prior["G:CXGroup"].dictionary().set(kMemberUIDState, Array{"a:CXPerson", "x:CXPerson", "y:CXPerson"});
+    now["G:CXGroup"].dictionary().set(kMemberUIDState, Array{"y:CXPerson", "z:CXPerson"});
+    EXPECT_EQ(unlistedContactsThatLeftAGroup(prior, now), std::vector{UniqueId("x:CXPerson")}) << "a is listed";
+    EXPECT_EQ(unlistedContactsThatLeftAGroup(prior, without(now, "G:CXGroup")).size(), 2u);
+    EXPECT_TRUE(unlistedContactsThatLeftAGroup(prior, prior).empty());
+    EXPECT_TRUE(unlistedContactsThatLeftAGroup({}, now).empty());
+}
+
 TEST(TreeCondition, AGroupThatHasLeftItsOwnersDatabaseAndTheTreeIsDeletedThoughEverybodysListNamesIt) {
     const Dictionary now = without(tree(), "G:CXGroup");
     const auto isHere = [](const UniqueId& uid) { return uid.str() != "G:CXGroup"; };

@@ -266,6 +266,34 @@ TEST_F(TwoWriters, AContactThatLiesInTheTreeAndIsInNoListIsTakenInByNobodyAndTak
     for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
 }
 
+// A pass reads one list after the other, and somebody writes both in between: a group names a new contact, and the list
+// of everybody that was read a moment before does not. The contact comes with the group, and goes with it.
+TEST_F(TwoWriters, AContactThatCameByAGroupAloneAndIsDeletedGoes) {
+    bob.pass();
+    const CXGroupRef circle = alice.group("Circle", {people[0]});
+    alice.pass();
+    const std::filesystem::path place = world->file(std::string(kCXAllGroupUID));
+    const std::string before = textOf(std::filesystem::is_directory(place) ? place / CXDAVManager::kStateName : place);
+    ASSERT_FALSE(before.empty());
+    const CXPersonRef dora = alice.add("Dora");
+    circle->addMember(dora);
+    alice.application->save();
+    alice.pass();
+    bob.wire->intercept([&](const HttpRequest& request) -> std::optional<HttpResponse> {
+        if (request.method != "GET" || request.url.path().find("/AllCXGroup") == std::string::npos) return std::nullopt;
+        return answerOf(200, {{"content-type", "text/plain"}, {"etag", "\"of-before\""}}, before);
+    });
+    bob.pass();
+    bob.wire->intercept({});
+    ASSERT_TRUE(bob.copyOf(dora)) << log.text();
+    alice.application->removeRecord(dora);
+    alice.application->save();
+    for (Participant* each : {&alice, &bob}) each->pass();
+    EXPECT_FALSE(bob.copyOf(dora)) << log.text();
+    EXPECT_EQ(copies(), alice.view());
+    for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
+}
+
 // Half of a writer's new contact is on the store when its owner looks, more than once, and the other half comes later.
 TEST_F(TwoWriters, AWritersNewContactIsKeptWhicheverHalfOfItIsLate) {
     bob.pass();

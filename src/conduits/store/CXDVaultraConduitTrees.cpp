@@ -303,14 +303,18 @@ void CXDVaultraConduit::compareUnlistedGroups(CXDChangeRecords& records) {
 
 // New contacts and groups that a killed pass has put there, in lists and all. Those that are nowhere any more have been
 // deleted by somebody, and leave the database, too. A leftover that its owner has taken away for want of a name is
-// written again.
+// written again. Contacts that came by a group alone leave likewise: the lists of one tree are read one after the
+// other, and somebody may write them in between.
 void CXDVaultraConduit::compareWhatHadCome(CXDChangeRecords& records) {
     const std::vector<CXReached> reached = whatHadCome();
     _lookedFor.clear();
-    if (reached.empty()) return;
+    const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
     const UniqueId everybody{std::string(layout::kAllGroup)};
     for (const auto& [user, state] : _read) {
-        std::vector<UniqueId> names;
+        std::vector<UniqueId> names = unlistedContactsThatLeftAGroup(users[user.str()].dictionary(), state);
+        std::erase_if(names, [&, &user = user](const UniqueId& name) {
+            return !_with.rolvane.recordForUniqueId(nameInDatabase(user, name));
+        });
         for (const CXReached& each : reached)
             if (each.tree == user) {
                 names.push_back(cxNormalizedUID(each.uniqueId));

@@ -314,6 +314,20 @@ std::vector<UniqueId> namesThatAreNowhere(const Dictionary& current, const std::
     return nowhere;
 }
 
+std::vector<UniqueId> unlistedContactsThatLeftAGroup(const Dictionary& prior, const Dictionary& current) {
+    std::vector<UniqueId> unlisted;
+    std::optional<ListedNames> listed;
+    for (const auto& [group, before] : prior) {
+        if (!isGroup(group) || group == kEverybody || before == current[group]) continue;
+        const Dictionary difference = groupDifference(before, current[group]);
+        for (const Value& name : difference[kMemberRemoves].array()) {
+            if (!listed) listed.emplace(prior, kMemberUIDState);
+            if (const UniqueId contact(name.string()); !listed->contains(contact)) unlisted.push_back(contact);
+        }
+    }
+    return unlisted;
+}
+
 CXDChangeRecordPtr removalOfContact(const UniqueId& person) {
     return ownersChange(CXDDeleteRecord, person, std::nullopt);
 }

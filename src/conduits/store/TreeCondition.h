@@ -106,6 +106,10 @@ std::vector<UniqueId> contactsThatAreUnlisted(const Dictionary& current, const s
 // The change that takes one contact off the store.
 CXDChangeRecordPtr removalOfContact(const UniqueId& person);
 
+// Contacts that a group has lost since `prior`, and that the list of everybody did not name there: its readers know
+// them by their groups alone.
+std::vector<UniqueId> unlistedContactsThatLeftAGroup(const Dictionary& prior, const Dictionary& current);
+
 // Those of the names, of contacts and groups, that the tree has neither a file of nor in any list. None while the list
 // of everybody is not there.
 std::vector<UniqueId> namesThatAreNowhere(const Dictionary& current, const std::vector<UniqueId>& names);
