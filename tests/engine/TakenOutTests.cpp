@@ -71,6 +71,19 @@ TEST_P(WhatIsTakenOut, OfAGroupThatIsDeletedHereNoChangeOnTheStoreIsTakenIn) {
     expectOnlyLeft(records, {deletion});
 }
 
+// A group's file keeps what it says of a member for some time behind the member's deletion.
+TEST_P(WhatIsTakenOut, WhatGroupsOfTheStoreStillSayOfSomebodyWhomItsListHasLostCountsForNothing) {
+    const auto removal = makeRecord(CXDRemoveRecordFromGroup, "P1:CXPerson", "AllCXGroup", there(GetParam()));
+    const auto other = makeRecord(CXDUpdateDistributionList, "P2:CXPerson", "G1:CXGroup", there(GetParam()));
+    const auto choice = makeRecord(CXDUpdateDistributionList, "P1:CXPerson", "G1:CXGroup", there(GetParam()));
+    const auto member = makeRecord(CXDAddRecordToGroup, "P1:CXSubscribedPerson", "G1:CXGroup", there(GetParam()));
+    const auto content = makeRecord(CXDUpdateRecord, "P1:CXSubscribedPerson", nullptr, there(GetParam()));
+    const auto leaving = makeRecord(CXDRemoveRecordFromGroup, "P1:CXPerson", "G2:CXGroup", there(GetParam()));
+    EXPECT_EQ(left({removal, other, leaving, choice, content, member}), (CXDChangeRecords{removal, other, leaving}));
+    const auto ofAnother = makeRecord(CXDUpdateDistributionList, "P1:CXPerson", "G1:CXGroup", there("zoe"));
+    EXPECT_EQ(left({removal, ofAnother}), (CXDChangeRecords{removal, ofAnother}));
+}
+
 TEST_P(WhatIsTakenOut, AContactThatOneSideTakesOutIsOutOnBoth) {
     const auto removal = makeRecord(CXDRemoveRecordFromGroup, "P1:CXPerson", "AllCXGroup", there(GetParam()));
     const auto leaving = makeRecord(CXDRemoveRecordFromGroup, "P1:CXPerson", "G1:CXGroup", here(GetParam()));

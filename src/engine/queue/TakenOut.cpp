@@ -57,11 +57,22 @@ bool TakenOut::concerns(const CXDChangeRecord& record) const {
     return !isRemoval(record) && isTakenOutByOthers(record, record.person());
 }
 
+// The store's list of everybody has lost the member, and a group there still names it, or a number of it.
+bool TakenOut::isLeftBehindThere(const CXDChangeRecord& record) const {
+    if (record.initialSource() != CXDSyncSourceVaultra || isRemoval(record) || !record.person()) return false;
+    const auto it = _sources.find(shared(record, *record.person()));
+    return it != _sources.end() && (it->second & CXDSyncSourceVaultra);
+}
+
 std::vector<GroupThatIsGone> TakenOut::drop(CXDChangeRecords& records) const {
     if (_sources.empty() || isLeftOut("deletions win")) return {};
     std::set<GroupThatIsGone> changedHere;
     std::erase_if(records, [&](const CXDChangeRecordPtr& record) {
         const bool isFromHere = record->initialSource() == CXDSyncSourceCX;
+        if (isLeftBehindThere(*record)) {
+            CXDLog("Rejecting %@", record);
+            return true;
+        }
         if (!concerns(*record)) {
             if (record->type() == CXDCompositeGroupChange) forgetAdditions(*record);
             return false;

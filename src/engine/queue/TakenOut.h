@@ -31,6 +31,9 @@ public:
     // Drops the records of the other side about what is out. But for those that bring changes of somebody else's
     // publication: that the removal made here is let through there is not known yet. Gives the groups in which changes
     // were made here for nothing: somebody has to be told.
+    //
+    // A store's records are dropped, too, about whom that store itself takes out: groups there name a contact, or a
+    // number of it, for some time behind its deletion. Mingling would take such a record for the later word.
     std::vector<GroupThatIsGone> drop(CXDChangeRecords& records) const;
 
     // True of a record about what the other side takes out.
@@ -42,6 +45,7 @@ private:
             return std::hash<UserName>{}(of.first) * 31 + std::hash<UniqueId>{}(of.second);
         }
     };
+    bool isLeftBehindThere(const CXDChangeRecord& record) const;
     bool isTakenOutByOthers(const CXDChangeRecord& record, const std::optional<UniqueId>& uid) const;
     void forgetAdditions(CXDChangeRecord& composite) const;
 
