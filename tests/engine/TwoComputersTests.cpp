@@ -384,6 +384,60 @@ TEST_F(TwoComputers, AWithdrawalOnOneIsNotUndoneByTheOther) {
     EXPECT_NE(laptop.alert.told[0].message.find("another computer"), std::string::npos);
 }
 
+// The tree is published again, in several passes: neither computer may wait for the other one meanwhile.
+TEST_F(TwoComputers, ATreeThatIsPublishedAgainGetsWhatTheFirstPassOfThatLeft) {
+    joinAndSettle();
+    ASSERT_GT(std::filesystem::remove_all(world->file(friends->uniqueId().str())), 0u);
+    const auto fails = std::make_shared<std::atomic<bool>>(true);
+    for (Participant* each : {&laptop, &desk})
+        each->wire->intercept([fails](const HttpRequest& request) -> std::optional<HttpResponse> {
+            const bool isOfAGroup = request.url.encodedPath().find("%3ACXGroup") != std::string::npos;
+            return *fails && request.method == "PUT" && isOfAGroup ? std::optional(answerOf(503)) : std::nullopt;
+        });
+    settle();
+    EXPECT_NE(log.text().find("It is published again"), std::string::npos) << log.text();
+    *fails = false;
+    name(laptop, people[0], "Adelheid");
+    name(desk, people[1], "Benjamin");
+    settle(5);
+    EXPECT_EQ(nameIn(desk, people[0]), "Adelheid") << log.text();
+    EXPECT_EQ(nameIn(laptop, people[1]), "Benjamin") << log.text();
+    expectEqual();
+    for (Participant* each : {&laptop, &desk}) EXPECT_TRUE(each->engine->getPendingChanges().empty());
+}
+
+TEST_F(TwoComputers, ATreeWhoseListIsLostIsPublishedAgainThoughTheFirstPassesOfThatWroteNothing) {
+    joinAndSettle();
+    std::filesystem::remove(world->file("AllCXGroup"));
+    const auto fails = std::make_shared<std::atomic<bool>>(true);
+    for (Participant* each : {&laptop, &desk})
+        each->wire->intercept([fails](const HttpRequest& request) -> std::optional<HttpResponse> {
+            return *fails && request.method == "PUT" ? std::optional(answerOf(503)) : std::nullopt;
+        });
+    settle();
+    *fails = false;
+    settle(5);
+    EXPECT_TRUE(std::filesystem::exists(world->file("AllCXGroup"))) << log.text();
+    EXPECT_EQ(laptop.countPeople(), 3u);
+    name(laptop, people[0], "Adelheid");
+    settle();
+    EXPECT_EQ(nameIn(desk, people[0]), "Adelheid") << log.text();
+    expectEqual();
+}
+
+TEST_F(TwoComputers, ALostListIsMadeAnewAndNamesAllWhoLieThere) {
+    joinAndSettle();
+    const CXPersonRef dora = laptop.add("Dora"); // the other computer does not know her yet
+    laptop.pass();
+    std::filesystem::remove(world->file("AllCXGroup"));
+    for (int pass = 0; pass < 3; ++pass) desk.pass();
+    EXPECT_TRUE(std::filesystem::exists(world->file("AllCXGroup"))) << log.text();
+    settle(5);
+    EXPECT_EQ(nameIn(laptop, dora), "Dora") << log.text();
+    EXPECT_EQ(laptop.countPeople(), 4u);
+    expectEqual();
+}
+
 TEST_F(TwoComputers, ALostMemoryIsMadeAnewBeforeAnythingIsWritten) {
     joinAndSettle();
     name(desk, people[0], "Adelheid");

@@ -37,19 +37,6 @@ std::string nameOf(const std::string& path, const FileInfo& info) {
     return std::string(text.substr(text.rfind('/') + 1));
 }
 
-// What a list of everybody would say of a store that has none: all that lies there. A list that was lost takes no group
-// along.
-Dictionary listOf(const Dictionary& userState) {
-    Array people, groups;
-    for (const auto& [contact, info] : userState[kPeopleState].dictionary()[kMemberUIDState].dictionary())
-        people.append(contact);
-    for (const auto& [name, group] : userState)
-        if (name.ends_with(kGroupSuffix)) groups.append(name);
-    Dictionary list{{kMemberUIDState, people}};
-    if (!groups.empty()) list.set(kSubgroupUIDState, groups);
-    return list;
-}
-
 // The groups of a listing that have to be read are, all at once, for as long as this lives. Large lists are read when
 // it is their turn.
 class ReadingGroupsAhead {
@@ -147,7 +134,8 @@ void CXDConduit::readLocation(const RemoteLocation& location, Dictionary& state)
     if (!isTrusted(user, *userState)) return _engine.treeWasLookedAt(user, TreeLook::leftAlone);
     // Without a serial number nothing of it counts.
     _engine.treeWasLookedAt(user, (*userState)[kSerialNumber].isString() ? TreeLook::read : TreeLook::notRead);
-    if (!userState->contains(layout::kAllGroup)) Dictionary(*userState).set(layout::kAllGroup, listOf(*userState));
+    if (!userState->contains(layout::kAllGroup))
+        Dictionary(*userState).set(layout::kAllGroup, listOfAllThatLiesThere(*userState));
     state.set(user.str(), *userState);
 }
 

@@ -132,7 +132,7 @@ void CXDVaultraConduit::open() {
     _writtenInOrder.clear();
     _compared.clear(); // of a pass that failed
     _lookedAt.clear();
-    _isOlderCopy = engine().conduitObjectForKey(kConduitCX, kPublishAgain)[kOlderCopy].boolean();
+    readPublishAgain();
     const int code = testReachability(gathering ? [this] { beginReading(); } : std::function<void()>());
     if (code == kCXDAVErrorAuthentication) {
         if (shouldWarnUserAboutUserNameOrPassword()) {

@@ -144,7 +144,8 @@ private:
     void beginReading();
     void lookAfterStructure(bool meanwhile); // while the pass goes on
     void awaitStructure();                   // any thread
-    void publishAgain(const TreeCondition& condition);
+    void publishAgain(const TreeCondition& condition, const Dictionary& state);
+    void readPublishAgain();
     void restoreAccessLists();
     bool isBeingMended();
     bool isMended(const Dictionary& prior, const Dictionary& state);
@@ -208,6 +209,7 @@ private:
     std::atomic<bool> _vaultraOffLine = false;
     std::atomic<bool> _isWrittenByOthers = false; // the own tree, as of the last open
     std::atomic<bool> _isOlderCopy = false;       // the own tree: it is older than the database
+    Dictionary _lostList; // of the own tree that is published again, as its files tell it; else empty
     std::atomic<bool> _ownTreeIsHeld = false;     // nothing of ours is written there yet
     bool _isOneOfSeveral = false;                 // as of the last look; constant while a pass writes, as are these two
     bool _takesIn = false;                        // this pass does nothing else with the own tree

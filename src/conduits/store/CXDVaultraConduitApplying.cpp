@@ -256,8 +256,12 @@ bool CXDVaultraConduit::writeComposite(CXDChangeRecord& record, const Dictionary
     if (!state && code == kMissing) {
         const bool isList = record.group()->str() == layout::kAllGroup;
         if (isList && !record.changeMadeByDataOwner()) return false; // it waits for its owner's
-        // Another computer would take a list of one change alone for the removal of everybody else.
-        if (isList && _isOneOfSeveral && lastKnownState(record).empty()) return false;
+        // Another computer would take a list of one change alone for the removal of everybody else. So a list that was
+        // lost names what the other one has put there, too.
+        if (isList && _isOneOfSeveral && lastKnownState(record).empty()) {
+            if (_lostList.empty()) return false;
+            state = _lostList;
+        }
         if (wasDeletedThere(record)) return true;
     }
     // A part alone would be taken for all of it.

@@ -30,6 +30,8 @@ namespace {
 
 // In the prior state of the owner's tree: something was amiss there that may be so for a moment only.
 constexpr const char* kLookAgain = "LookAgain";
+// In kPublishAgain: what a list of everybody would say that was lost, where several computers write it.
+constexpr const char* kLostList = "lostList";
 
 // People and groups of a tree's list of everybody.
 class ListedRecords {
@@ -83,7 +85,7 @@ bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state)
     if (condition.mayPass() && !looked)
         prior.set(kLookAgain, true);
     else
-        publishAgain(condition);
+        publishAgain(condition, state);
     engine().bringSourcesUpToDate(); // after this pass
     return false;
 }
@@ -255,7 +257,7 @@ CXDChangeRecords CXDVaultraConduit::changeRecords() {
     CXDChangeRecords records = CXDConduit::changeRecords();
     if (_with.rolvane.allGroup()->valueForProperty(kCXRemoteLocationProperty) && endedPublication(_with.preferences))
         _with.preferences.remove(kDaemonDomain, kCXDEndedPublication); // published again since
-    _isOlderCopy = engine().conduitObjectForKey(kConduitCX, kPublishAgain)[kOlderCopy].boolean();
+    readPublishAgain();
     std::set<UserName> changed;
     for (const CXDChangeRecordPtr& record : records)
         if (record->user()) changed.insert(*record->user());
@@ -473,11 +475,19 @@ bool CXDVaultraConduit::findsAgain(const CXDChangeRecord& record) const {
 }
 
 // The next scan takes everything for new.
-void CXDVaultraConduit::publishAgain(const TreeCondition& condition) {
+void CXDVaultraConduit::publishAgain(const TreeCondition& condition, const Dictionary& state) {
     Dictionary again = engine().conduitObjectForKey(kConduitCX, kPublishAgain);
     again.set(kSelf.str(), false);
     if (condition.kind == TreeCondition::Kind::setBack) again.set(kOlderCopy, true);
+    if (_isOneOfSeveral && !state[std::string(layout::kAllGroup)].dictionary()[kMemberUIDState].isArray())
+        again.set(kLostList, listOfAllThatLiesThere(state));
     restoreAccessLists();
+}
+
+void CXDVaultraConduit::readPublishAgain() {
+    const Dictionary again = engine().conduitObjectForKey(kConduitCX, kPublishAgain);
+    _isOlderCopy = again[kOlderCopy].boolean();
+    _lostList = again[kLostList].dictionary();
 }
 
 // Until all of it is written, what the owner's tree says is not news, and nobody is told that the owner has been there.

@@ -126,6 +126,17 @@ Dictionary datesToWaitFor(const Dictionary& current) {
     return dates;
 }
 
+Dictionary listOfAllThatLiesThere(const Dictionary& current) {
+    Array people, groups;
+    for (const auto& [contact, info] : current[kPeopleState].dictionary()[kMemberUIDState].dictionary())
+        people.append(contact);
+    for (const auto& [name, group] : current)
+        if (isGroup(name)) groups.append(name);
+    Dictionary list{{kMemberUIDState, people}};
+    if (!groups.empty()) list.set(kSubgroupUIDState, groups);
+    return list;
+}
+
 CXDChangeRecords removalOfLeftovers(const Dictionary& prior, const Dictionary& current) {
     CXDChangeRecords removals;
     const auto remove = [&](CXDChangeType type, std::optional<UniqueId> person, std::optional<UniqueId> group,

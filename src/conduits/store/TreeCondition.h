@@ -61,6 +61,9 @@ TreeCondition treeCondition(const Dictionary& prior, const Dictionary& current, 
 // until its owner has been there again.
 Dictionary datesToWaitFor(const Dictionary& current);
 
+// A list of everybody for a store that has none. One that was lost takes no group along.
+Dictionary listOfAllThatLiesThere(const Dictionary& current);
+
 // The changes of the owner's that take off the store whatever `prior` does not know: members, groups and contacts.
 CXDChangeRecords removalOfLeftovers(const Dictionary& prior, const Dictionary& current);
 
