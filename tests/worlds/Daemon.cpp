@@ -5,6 +5,7 @@
 #include "conduits/store/CXDVaultraConduit.h"
 #include "foundation/CXException.h"
 #include "foundation/Log.h"
+#include "model/PayloadKeys.h"
 #include "store/locks/StoreLock.h"
 
 #include <unistd.h>
@@ -86,7 +87,9 @@ void Daemon::deliver() {
 }
 
 bool Daemon::nothingWaits() {
-    return _engine->getPendingChanges().empty() && !_database->hasExternalChanges();
+    CXDSyncEngine& engine = *_engine; // what its store has refused rests, and is not among the changes that wait
+    return engine.getPendingChanges().empty() && !_database->hasExternalChanges() &&
+           engine.conduitObjectForKey(kConduitCX, kRefusedByStore).empty();
 }
 
 } // namespace rolvane::worlds

@@ -31,11 +31,15 @@ std::set<std::string> marksIn(const std::string& value) {
 void Model::take(const Deed& deed) {
     ++deeds;
     Thing& thing = _things[deed.thing];
-    _recent[deed.who].push_back({deed.thing, deed.cell, deed.kind});
+    _recent[deed.who].push_back(deed);
     switch (deed.kind) {
     case Deed::Kind::makePerson:
     case Deed::Kind::makeGroup: thing.isGroup = deed.kind == Deed::Kind::makeGroup; return;
-    case Deed::Kind::remove: thing.removed = true; return;
+    case Deed::Kind::remove:
+        thing.removed = true;
+        for (const auto& [who, things] : _madeThereAgain)
+            if (who != deed.who && things.contains(deed.thing)) thing.cameBack = true;
+        return;
     case Deed::Kind::set: break;
     }
     thing.editors.insert(deed.who);
@@ -56,10 +60,35 @@ void Model::take(const Deed& deed) {
 
 void Model::settled(char who) {
     _recent[who].clear();
+    _madeThereAgain[who].clear();
+}
+
+std::vector<Deed> Model::unsettled(char who) const {
+    const auto found = _recent.find(who);
+    return found == _recent.end() ? std::vector<Deed>{} : found->second;
+}
+
+void Model::comeBack(const std::vector<Deed>& unsent, char who) {
+    std::map<std::pair<std::string, std::string>, std::string> last;
+    std::set<std::string>& made = _madeThereAgain[who];
+    for (const Deed& deed : unsent) switch (deed.kind) {
+        case Deed::Kind::makePerson:
+        case Deed::Kind::makeGroup: made.insert(deed.thing); break;
+        case Deed::Kind::remove: made.erase(deed.thing); break;
+        case Deed::Kind::set: last[{deed.thing, deed.cell}] = deed.after; break;
+        }
+    for (const std::string& thing : made) _things[thing].cameBack = _things[thing].removed;
+    for (const auto& [part, value] : last) {
+        Cell& cell = _things[part.first].cells[part.second];
+        if (isLabelled(part.second))
+            cell.anything = true;
+        else
+            cell.heads.push_back({who, value});
+    }
 }
 
 void Model::refused(char who) {
-    for (const Recent& recent : _recent[who]) {
+    for (const Deed& recent : _recent[who]) {
         Thing& thing = _things[recent.thing];
         if (recent.kind == Deed::Kind::set)
             thing.cells[recent.cell].anything = true;
@@ -75,7 +104,7 @@ const Model::Thing* Model::known(const std::string& thing) const {
 
 bool Model::mustBeAbsent(const std::string& name) const {
     const Thing* thing = known(name);
-    return !thing || (thing->removed && !thing->mayBeThere);
+    return !thing || (thing->removed && !thing->mayBeThere && !thing->cameBack);
 }
 
 // Whether the inner group may have been seen to hold the outer one, over others perhaps: of two people who list two
@@ -101,10 +130,10 @@ bool Model::mayStand(const std::string& name, const Thing& thing, const std::str
     if (const std::string other = othersName(cell); !other.empty()) {
         if (mustBeAbsent(other)) return value.empty();
         const Thing* member = known(other);
-        if (member->mayBeMissing && value.empty()) return true;
+        if ((member->mayBeMissing || member->cameBack) && value.empty()) return true;
         if (cell.starts_with("Group/") && value.empty() && couldCloseACircle(name, other)) return true;
     }
-    const bool any = state.anything || (!mergesProperties && thing.editors.size() > 1);
+    const bool any = state.anything || thing.cameBack || (!mergesProperties && thing.editors.size() > 1);
     if (isLabelled(cell)) {
         const std::set<std::string> marks = marksIn(value);
         std::set<std::string> all;
@@ -123,7 +152,7 @@ void Model::judge(const std::string& name, const Thing& thing, const Cells* ther
         if (!thing.removed && !thing.mayBeMissing) out.push_back(name + " is missing, and nobody removed it");
         return;
     }
-    if (thing.removed && !thing.mayBeThere) {
+    if (thing.removed && !thing.mayBeThere && !thing.cameBack) {
         out.push_back(name + " is there, and was removed");
         return;
     }

@@ -45,6 +45,14 @@ public:
     void settled(char who);
     // The store has refused something of the person's, who is not the owner. What is not settled may stay or go.
     void refused(char who);
+    // What the person did since the last settling, so that it may be on no store yet.
+    std::vector<Deed> unsettled(char who) const;
+    // A state comes back in which these deeds were not sent, and all of them have been since. `who` edits there now.
+    // Nothing that is stored tells what became of them meanwhile, as no store keeps a note of whom it has lost:
+    // - A contact or group that was made there may be there again, though somebody has removed it. So it may where
+    //   somebody removes it before that computer has settled.
+    // - A part has again the value that was given it there, or the one that has replaced it since.
+    void comeBack(const std::vector<Deed>& unsent, char who);
 
     // What is wrong with the copy, a line each; nothing when all is well.
     std::vector<std::string> differences(const View& view) const;
@@ -66,13 +74,9 @@ private:
     struct Thing {
         bool isGroup = false;
         bool mayBeMissing = false, mayBeThere = false; // both: its making or its removal was refused
-        bool removed = false;
+        bool removed = false, cameBack = false;
         std::set<char> editors;
         std::map<std::string, Cell> cells;
-    };
-    struct Recent {
-        std::string thing, cell; // cell "": made or removed
-        Deed::Kind kind;
     };
     const Thing* known(const std::string& thing) const;
     bool mustBeAbsent(const std::string& thing) const;
@@ -81,7 +85,8 @@ private:
     void judge(const std::string& name, const Thing& thing, const Cells* there, std::vector<std::string>& out) const;
 
     std::map<std::string, Thing> _things;
-    std::map<char, std::vector<Recent>> _recent; // since the last settling
+    std::map<char, std::vector<Deed>> _recent;             // since the last settling
+    std::map<char, std::set<std::string>> _madeThereAgain; // things that came back, until the next settling
 };
 
 } // namespace rolvane::worlds

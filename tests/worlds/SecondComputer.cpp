@@ -28,6 +28,10 @@ std::vector<std::string> usersIn(CXRolvane& database, const char* property) {
     return users;
 }
 
+std::set<std::string> setOf(const std::vector<std::string>& users) {
+    return {users.begin(), users.end()};
+}
+
 std::string joined(const std::set<std::string>& users) {
     std::string text;
     for (const std::string& user : users) text += user + " ";
@@ -126,19 +130,20 @@ void World::keep(char role) {
     const std::string kept = person(role).directory + ".kept";
     fs::remove_all(kept);
     fs::copy(person(role).directory, kept, fs::copy_options::recursive);
-    _kept.insert(role);
+    _kept[role] = {_model.unsettled(selfOf(role)), _rightsToSend.contains(role)};
 }
 
 // The database alone, or the whole home. What was sent by then is on the store, and counts; where something was left
 // the person has taken it back. Whoever edits there now has not seen what that computer did since: the model takes it
-// for somebody else.
+// for somebody else. What had not been sent in that state is sent a second time, as no store tells that it was there.
 void World::putBack(char role) {
     const bool alone = _chance.happens(0.5);
     _settled.erase(role);
+    _afterRest = true;
     for (int pass = 0; pass < 3; ++pass) clean(role); // a tree that is taken in first needs two
-    const auto former = _selves.find(role);
+    _afterRest = false;
     if (!_settled.contains(role)) {
-        _model.refused(former == _selves.end() ? role : former->second);
+        _model.refused(selfOf(role));
         _mayRead[role] = std::nullopt;
     }
     tell("== " + std::string(alone ? "database" : "home") + " of " + role + " is put back");
@@ -149,16 +154,38 @@ void World::putBack(char role) {
         if (!alone || entry.path().filename().string().starts_with("contacts.db"))
             fs::copy(entry.path(), here / entry.path().filename(), fs::copy_options::recursive);
     fs::remove_all(kept);
-    _kept.erase(role);
     _selves[role] = static_cast<char>('0' + ++_outcome.restored);
+    _model.comeBack(_kept[role].deeds, _selves[role]);
+    if (_kept[role].rights) _mayRead[role] = std::nullopt;
+    _kept.erase(role);
 }
 
 // Rights --------------------------------------------------------------------------------------------------------------
 
+// The person takes a right that this computer shows, and grants one that it does not: another former state shows
+// others.
 void World::changeRights(char role) {
+    View shown;
+    inProcess(
+        "looking at rights", role,
+        [&](Report& report) {
+            CXRolvane database(CXRolvane::Options{.path = person(role).database(), .program = "rolvane"});
+            View view;
+            view.whole["readers"] = joined(setOf(usersIn(database, kCXReadSharingACLProperty)));
+            report.view(view);
+        },
+        &shown);
     std::optional<bool>& mayRead = _mayRead[role];
-    mayRead = !mayRead.value_or(false);
+    mayRead = (" " + shown.whole["readers"]).find(" " + readerOf(role) + " ") == std::string::npos;
+    _rightsToSend.insert(role);
     inProcess(*mayRead ? "sharing" : "unsharing", role, [&](Report&) {
+        if (!*mayRead) { // on the store first, as the command does it
+            CXDAVManager store(person(role).account, signedIn(person(role)));
+            std::vector<std::string> there, writers;
+            store.ACLsAtURL(person(role).tree, there, writers);
+            std::erase(there, readerOf(role));
+            store.setACLsWithReadPrincipals(there, writers, person(role).tree);
+        }
         CXRolvane database(CXRolvane::Options{.path = person(role).database(), .program = "rolvane"});
         std::vector<std::string> readers = usersIn(database, kCXReadSharingACLProperty);
         std::erase(readers, readerOf(role));
@@ -177,8 +204,7 @@ std::vector<std::string> World::wrongRights() {
             std::vector<std::string> readers, writers;
             View view;
             if (!store.ACLsAtURL(person('o').tree, readers, writers)) view.faults.push_back("no lists are shown");
-            view.whole["store"] =
-                joined({readers.begin(), readers.end()}) + "| " + joined({writers.begin(), writers.end()});
+            view.whole["store"] = joined(setOf(readers)) + "| " + joined(setOf(writers));
             report.view(view);
         },
         &seen);
@@ -190,8 +216,7 @@ std::vector<std::string> World::wrongRights() {
                 const auto readers = usersIn(database, kCXReadSharingACLProperty),
                            writers = usersIn(database, kCXReadWriteSharingACLProperty);
                 View view;
-                view.whole[std::string(1, role)] =
-                    joined({readers.begin(), readers.end()}) + "| " + joined({writers.begin(), writers.end()});
+                view.whole[std::string(1, role)] = joined(setOf(readers)) + "| " + joined(setOf(writers));
                 report.view(view);
             },
             &seen);

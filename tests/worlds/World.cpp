@@ -93,6 +93,11 @@ Person& World::person(char role) {
     return *std::find_if(_people.begin(), _people.end(), [&](const Person& each) { return each.role == role; });
 }
 
+char World::selfOf(char role) const {
+    const auto former = _selves.find(role);
+    return former == _selves.end() ? role : former->second;
+}
+
 std::vector<char> World::roles() const {
     return _hasJoined ? std::vector<char>{'o', 's', 'w', 'r'} : std::vector<char>{'o', 'w', 'r'};
 }
@@ -224,8 +229,7 @@ void World::take(char who, const std::string& line, View* view) {
     const std::vector<std::string> fields = fieldsOf(line);
     if (kind != lines::kPerson && kind != lines::kGroup && kind != lines::kCell && kind != lines::kWhole)
         tell("   " + line);
-    const auto former = _selves.find(who);
-    const char self = former == _selves.end() ? who : former->second;
+    const char self = selfOf(who);
     switch (kind) {
     case lines::kDeed: {
         Deed deed = deedOf(fields);
@@ -244,6 +248,7 @@ void World::take(char who, const std::string& line, View* view) {
     case lines::kSettled:
         _model.settled(self);
         _settled.insert(who);
+        _rightsToSend.erase(who);
         break;
     case lines::kWrote: _wrote.push_back(std::string(1, who) + " " + fields.at(0)); break;
     case lines::kThrew: ++_outcome.exceptions; break;
@@ -372,6 +377,7 @@ void World::clean(char role) {
         constexpr double kAnHour = 3600, kAWeek = 7 * 86400;
         Weather calm;
         if (_settling) calm.later = kAnHour + static_cast<double>(_outcome.cleanPasses) * kAWeek;
+        if (_afterRest) calm.later = kAnHour;
         calm.ownTree = "/dav/" + person(role).account.user.str() + "/";
         Daemon daemon(person(role), calm, report);
         daemon.pass();

@@ -57,6 +57,7 @@ private:
     bool with(const char* what) const { return !_options.without.contains(what); }
     Person& person(char role);
     std::vector<char> roles() const; // whoever takes part by now
+    char selfOf(char role) const;    // whom the model takes it for
 
     using Work = std::function<void(Report&)>;
     struct Job {
@@ -106,11 +107,17 @@ private:
     Outcome _outcome;
     std::vector<std::string> _wrong, _wrote; // what processes told
     bool _settling = false;                  // all is well again
+    bool _afterRest = false;                 // clean daemons live an hour later
     size_t _joinsAt = 0;                     // step; 0: never
     bool _hasJoined = false;
     std::map<char, char> _selves; // role -> whom the model takes it for, once a former state was put back
     std::set<char> _settled;      // roles of which a pass has ended without anything left
-    std::set<char> _kept;         // the computers with a former state that can be put back
+    struct NotSent {
+        std::vector<Deed> deeds;
+        bool rights = false;
+    };
+    std::map<char, NotSent> _kept; // the computers with a former state that can be put back: what was not sent in it
+    std::set<char> _rightsToSend;  // roles that changed rights since their last settling
     std::map<char, std::optional<bool>> _mayRead; // whom that computer alone gives and takes the right; none: unsure
     int _log = -1;
     size_t _processes = 0;
