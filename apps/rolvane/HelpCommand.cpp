@@ -73,7 +73,7 @@ void help(const CLI::App& app, const std::vector<std::string>& words) {
     if (words.size() == 1)
         for (const Topic& topic : topics())
             if (words.front() == topic.name) {
-                std::cout << topic.text;
+                std::cout << fitted(topic.text, terminalColumns(STDOUT_FILENO));
                 return;
             }
     const CLI::App* command = commandNamed(app, words);

@@ -21,7 +21,43 @@ size_t indentOf(const std::string& line) {
     return isNumbered ? line.find_first_not_of(' ', 3) : 0;
 }
 
+// Where the meaning of a row begins, behind blanks; npos of another line.
+size_t meaningIn(const std::string& line) {
+    const size_t blanks = line.find("  ", line.find_first_not_of(' '));
+    return blanks == std::string::npos ? blanks : line.find_first_not_of(' ', blanks);
+}
+
+std::string fittedRow(const std::string& line, size_t columns) {
+    const size_t meaning = meaningIn(line);
+    if (columnsOf(line) < columns) return line + "\n";
+    const std::string name = line.substr(0, line.find_last_not_of(' ', meaning - 1) + 1), rest = line.substr(meaning);
+    const std::string indent(kNarrowIndent, ' ');
+    return name + "\n" + indent + wrapped(rest, columns, kNarrowIndent) + "\n";
+}
+
 } // namespace
+
+std::string fitted(const std::string& text, size_t columns) {
+    if (columns == 0) return text;
+    std::string out, prose;
+    const auto endProse = [&] {
+        if (!prose.empty()) out += wrapped(prose, columns, 0) + "\n";
+        prose.clear();
+    };
+    std::istringstream lines(text);
+    for (std::string line; std::getline(lines, line);) {
+        const size_t indent = indentOf(line);
+        if (indent == 0 && meaningIn(line) == std::string::npos) {
+            prose += line + " ";
+            continue;
+        }
+        endProse();
+        out += indent > 0 ? line.substr(0, indent) + wrapped(line.substr(indent), columns, indent) + "\n"
+                          : fittedRow(line, columns);
+    }
+    endProse();
+    return out;
+}
 
 std::string wrapped(const std::string& text, size_t columns, size_t indent) {
     if (columns == 0) return text;

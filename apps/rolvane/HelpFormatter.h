@@ -28,4 +28,8 @@ private:
 // first begin with `indent` blanks. The first line begins in column `indent`. All of it in one line for 0 columns.
 std::string wrapped(const std::string& text, size_t columns, size_t indent);
 
+// A text of several lines, made to fit. Numbered lines ("  3  meaning") and rows ("path   meaning") stay lines of their
+// own, and their meanings go on below. Other lines are prose and become one paragraph. As it is for 0 columns.
+std::string fitted(const std::string& text, size_t columns);
+
 } // namespace rolvane::cli

@@ -1,5 +1,6 @@
 #include "conduits/LocalizedText.h"
 
+#include <clocale>
 #include <libintl.h>
 #include <map>
 #include <string_view>
@@ -43,10 +44,37 @@ const std::map<std::string_view, const char*>& builtInTexts() {
     return texts;
 }
 
+constexpr const char* kDomain = "CXStrings";
+
+// The language of this thread, as the environment has it, for as long as this lives.
+class PersonsLanguage {
+public:
+    PersonsLanguage() {
+        _messages = ::newlocale(LC_MESSAGES_MASK, "", nullptr);
+        if (_messages) _before = ::uselocale(_messages);
+    }
+    ~PersonsLanguage() {
+        if (!_messages) return;
+        ::uselocale(_before);
+        ::freelocale(_messages);
+    }
+    PersonsLanguage(const PersonsLanguage&) = delete;
+    PersonsLanguage& operator=(const PersonsLanguage&) = delete;
+
+private:
+    locale_t _messages = nullptr, _before = nullptr; // null where the system has no such language
+};
+
 } // namespace
 
+void useCatalogsIn(const std::string& directory) {
+    ::bindtextdomain(kDomain, directory.c_str());
+    ::bind_textdomain_codeset(kDomain, "UTF-8");
+}
+
 std::string localizedText(const char* key) {
-    const char* translated = dgettext("CXStrings", key);
+    const PersonsLanguage language;
+    const char* translated = dgettext(kDomain, key);
     if (translated != key && std::string_view(translated) != key) return translated;
     const auto found = builtInTexts().find(key);
     return found == builtInTexts().end() ? key : found->second;

@@ -2,6 +2,7 @@
 
 #include "daemon/DaemonOptions.h"
 
+#include "conduits/LocalizedText.h"
 #include "conduits/WithdrawalNotice.h"
 #include "conduits/database/CXDCXConduit.h"
 #include "conduits/store/CXDVaultraConduit.h"
@@ -42,6 +43,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <filesystem>
 #include <optional>
 #include <random>
 #include <string_view>
@@ -340,11 +342,21 @@ private:
     std::shared_ptr<Watchdog> _watchdog;  // none where nobody watches
 };
 
+// Beside the installed program, or where the build has made them.
+std::string catalogsOfAlerts() {
+    std::error_code error;
+    const auto program = std::filesystem::read_symlink("/proc/self/exe", error).parent_path().parent_path();
+    const auto installed = program / "share/locale";
+    return std::filesystem::exists(installed / "de/LC_MESSAGES/CXStrings.mo", error) ? installed
+                                                                                     : program.parent_path() / "po";
+}
+
 } // namespace
 
 int runDaemon(int argc, char** argv) {
     constexpr double kTerminationGrace = 4.5; // seconds; the promise is five
     shareHeaps();
+    useCatalogsIn(catalogsOfAlerts());
     const TerminationWatch watch([] { termination().ask(); }, kTerminationGrace);
     std::optional<InstanceLock> lock; // outlives the daemon, whose socket lies where the next one's will
     try {

@@ -113,7 +113,8 @@ TEST_F(Terminals, AndPipesHaveTheSameExitCodesAndNoColours) {
 // But for the command lines of examples, which are to be copied.
 TEST_F(Terminals, OfEveryWidthHaveRoomForTheHelp) {
     for (const unsigned short columns : {40, 60, 80, 120})
-        for (const char* command : {"help", "help setup", "help books on", "publish --help"})
+        for (const char* command : {"help", "help setup", "help books on", "publish --help", "help names",
+                                    "help output", "help files", "help exit-codes"})
             for (const char* language : {"C", "de_DE.UTF-8"}) {
                 const Shown shown = at(columns, language, command);
                 EXPECT_EQ(shown.status, kDone) << shown.text;
