@@ -18,27 +18,53 @@ constexpr size_t kIndexFrom = 24;               // below this a linear search is
 constexpr size_t kMostIndexed = UINT32_MAX - 2; // places have 32 bits
 constexpr size_t kAhead = 4;                    // removals whose places in the index are under way from memory
 
-// Tells two containers with the same content apart from others without a look at the content: a copy that was made by
-// deepMutableCopy has the number of its original until one of the two changes. Only of containers without others
-// inside, which change by themselves.
+// Tells that two containers have the same content without a look at it. A copy that was made by deepMutableCopy has the
+// number of its original until one of the two changes. Two dictionaries of dictionaries get one number when they were
+// found equal. The dictionaries inside change by themselves, perhaps in another's hand. So each of them knows that it
+// is inside, and its change makes the numbers of all dictionaries of dictionaries void. That is seldom: what stands
+// inside is mostly replaced as a whole.
 class ContentMark {
 public:
-    void forget() { _number.store(0, std::memory_order_relaxed); }
-    void become(ContentMark& original) { _number.store(original.number(), std::memory_order_relaxed); }
+    void changes() {
+        _number.store(0, std::memory_order_relaxed);
+        if (!_isInside.load(std::memory_order_relaxed)) return;
+        const uint64_t now = next();
+        uint64_t last = lastInside().load(std::memory_order_relaxed);
+        while (last < now && !lastInside().compare_exchange_weak(last, now, std::memory_order_relaxed)) {
+        }
+    }
+    void goInside() { _isInside.store(true, std::memory_order_relaxed); }
+    // `holdsContainers`: each of them knows by now that it is inside.
+    void become(ContentMark& original, bool holdsContainers) {
+        _number.store(original.number(holdsContainers), std::memory_order_relaxed);
+    }
     bool isThatOf(const ContentMark& other) const {
         const uint64_t own = _number.load(std::memory_order_relaxed);
-        return own != 0 && own == other._number.load(std::memory_order_relaxed);
+        return own != 0 && own == other._number.load(std::memory_order_relaxed) && isValid(own);
     }
 
 private:
-    uint64_t number() { // readers on several threads may ask for the first time at once
+    static constexpr uint64_t kHoldsContainers = 1;
+
+    static uint64_t next() { // another one each time, and greater
         static std::atomic<uint64_t> last{0};
+        return last.fetch_add(2, std::memory_order_relaxed) + 2;
+    }
+    static std::atomic<uint64_t>& lastInside() { // the last change of a container in another one
+        static std::atomic<uint64_t> one{0};
+        return one;
+    }
+    static bool isValid(uint64_t number) {
+        return (number & kHoldsContainers) == 0 || number > lastInside().load(std::memory_order_relaxed);
+    }
+    uint64_t number(bool holdsContainers) { // readers on several threads may ask for the first time at once
         uint64_t held = _number.load(std::memory_order_relaxed);
-        if (held != 0) return held;
-        const uint64_t fresh = ++last;
+        if (held != 0 && isValid(held)) return held;
+        const uint64_t fresh = next() | (holdsContainers ? kHoldsContainers : 0);
         return _number.compare_exchange_strong(held, fresh) ? fresh : held;
     }
     std::atomic<uint64_t> _number{0}; // 0: nothing is known
+    std::atomic<bool> _isInside{false};
 };
 
 bool isContainer(const Value& value) {
@@ -144,7 +170,7 @@ struct Array::Storage : SharedObject {
     void dropIndex() { delete index.exchange(nullptr); }
 
     void takeOut(const SharedText& text) {
-        mark.forget();
+        mark.changes();
         indexed();
         Places& places = *index.load();
         places.eraseIf(text.hash(), [&](uint32_t place) {
@@ -182,8 +208,25 @@ struct Array::Storage : SharedObject {
 };
 
 struct Dictionary::Storage : SharedObject {
+    static constexpr size_t kMany = 8; // from so many dictionaries on a note is worth its while
     Map map;
     ContentMark mark;
+
+    bool holdsContainers() const {
+        return std::any_of(map.begin(), map.end(), [](const auto& entry) { return isContainer(entry.second); });
+    }
+    bool isOfPlainDictionaries() const {
+        return std::all_of(map.begin(), map.end(), [](const auto& entry) {
+            const Dictionary* inner = entry.second.dictionaryIf();
+            return inner && !inner->_p->holdsContainers();
+        });
+    }
+    static void noteEqual(Storage& a, Storage& b) {
+        if (a.map.size() < kMany || !a.isOfPlainDictionaries()) return;
+        for (const Storage* each : {&a, &b})
+            for (const auto& [key, inner] : each->map) inner.dictionaryIf()->_p->mark.goInside();
+        b.mark.become(a.mark, true);
+    }
 };
 
 Array::Array() : _p(new Storage) {}
@@ -220,7 +263,7 @@ const Value& Array::operator[](size_t i) const {
 }
 
 void Array::append(Value v) {
-    _p->mark.forget();
+    _p->mark.changes();
     _p->items.push_back(std::move(v));
     _p->appended();
 }
@@ -238,21 +281,21 @@ void Array::insert(size_t index, Value v) {
         throw CXException(kCXRangeException,
                           fmt::format("index {} is beyond the end of an array of {}", index, count()));
     items(); // closes the gaps
-    _p->mark.forget();
+    _p->mark.changes();
     _p->dropIndex();
     _p->items.insert(_p->items.begin() + static_cast<std::ptrdiff_t>(index), std::move(v));
 }
 
 void Array::replace(size_t index, Value v) {
     (*this)[index];
-    _p->mark.forget();
+    _p->mark.changes();
     _p->dropIndex();
     _p->items[index] = std::move(v);
 }
 
 void Array::removeAt(size_t index) {
     (*this)[index];
-    _p->mark.forget();
+    _p->mark.changes();
     _p->dropIndex();
     _p->items.erase(_p->items.begin() + static_cast<std::ptrdiff_t>(index));
 }
@@ -262,7 +305,7 @@ void Array::removeAll(const Value& v) {
     const SharedText* text = wanted.textIf();
     if (text && _p->isIndexed()) return _p->takeOut(*text);
     items(); // closes the gaps
-    _p->mark.forget();
+    _p->mark.changes();
     if (std::erase(_p->items, wanted) != 0) _p->dropIndex();
 }
 
@@ -270,7 +313,7 @@ void Array::removeAllOf(const Array& others) {
     if (others.empty()) return;
     const Array gone = others.isSame(*this) ? others.mutableCopy() : others;
     items(); // closes the gaps
-    _p->mark.forget();
+    _p->mark.changes();
     if (std::erase_if(_p->items, [&](const Value& v) { return gone.contains(v); }) != 0) _p->dropIndex();
 }
 
@@ -299,7 +342,7 @@ std::optional<size_t> Array::indexOf(const Value& v) const {
 
 Array Array::mutableCopy() const {
     Array copy(items());
-    if (std::none_of(_p->items.begin(), _p->items.end(), isContainer)) copy._p->mark.become(_p->mark);
+    if (std::none_of(_p->items.begin(), _p->items.end(), isContainer)) copy._p->mark.become(_p->mark, false);
     return copy;
 }
 
@@ -338,7 +381,7 @@ void Dictionary::set(std::string_view key, Value v) {
     if (v.isAbsent())
         throw CXException(kCXInvalidArgumentException,
                           fmt::format("an absent value cannot be stored in a dictionary (key \"{}\")", key));
-    _p->mark.forget();
+    _p->mark.changes();
     if (auto it = _p->map.find(key); it != _p->map.end())
         it->second = std::move(v);
     else
@@ -349,14 +392,14 @@ bool Dictionary::setIfNew(std::string&& key, Value v) {
     if (v.isAbsent())
         throw CXException(kCXInvalidArgumentException,
                           fmt::format("an absent value cannot be stored in a dictionary (key \"{}\")", key));
-    _p->mark.forget();
+    _p->mark.changes();
     const size_t before = _p->map.size();
     _p->map.try_emplace(_p->map.end(), std::move(key), std::move(v)); // the hint makes ascending keys cheap
     return _p->map.size() != before;
 }
 
 void Dictionary::remove(std::string_view key) {
-    _p->mark.forget();
+    _p->mark.changes();
     if (auto it = _p->map.find(key); it != _p->map.end()) _p->map.erase(it);
 }
 
@@ -390,12 +433,15 @@ Dictionary Dictionary::mutableCopy() const {
     Dictionary copy;
     copy._p->map = _p->map;
     if (std::none_of(begin(), end(), [](const auto& entry) { return isContainer(entry.second); }))
-        copy._p->mark.become(_p->mark);
+        copy._p->mark.become(_p->mark, false);
     return copy;
 }
 
 bool operator==(const Dictionary& a, const Dictionary& b) {
-    return a._p == b._p || a._p->mark.isThatOf(b._p->mark) || a._p->map == b._p->map;
+    if (a._p == b._p || a._p->mark.isThatOf(b._p->mark)) return true;
+    if (a._p->map != b._p->map) return false;
+    Dictionary::Storage::noteEqual(*a._p, *b._p);
+    return true;
 }
 
 bool Value::boolean(bool otherwise) const {

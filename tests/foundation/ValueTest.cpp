@@ -262,6 +262,33 @@ RC_GTEST_PROP(ValueTest, CopiesAreEqualForAsLongAsTheirElementsAre, ()) {
     }
 }
 
+// Dictionaries of dictionaries that were found equal are known to be so until one of all these changes.
+RC_GTEST_PROP(ValueTest, DictionariesOfDictionariesAreEqualForAsLongAsTheirElementsAre, ()) {
+    Dictionary first;
+    for (int i = 0; i < 12; ++i) first.set("p" + std::to_string(i), Dictionary{{"Email", std::to_string(i % 3)}});
+    std::vector<Dictionary> all{first, Value(first).deepMutableCopy().dictionary()};
+    std::vector<Dictionary> held{all[0]["p1"].dictionary(), all[1]["p2"].dictionary()}; // somebody has them in hand
+    const auto steps = *rc::gen::container<std::vector<int>>(rc::gen::inRange(0, 8));
+    for (const int step : steps) {
+        Dictionary& chosen = all[*rc::gen::inRange<size_t>(0, all.size())];
+        const std::string key = "p" + std::to_string(*rc::gen::inRange(0, 12));
+        const std::string text = std::to_string(*rc::gen::inRange(0, 3));
+        switch (step) {
+        case 0: chosen.dictionaryFor(key).set("Email", text); break;
+        case 1: held[*rc::gen::inRange<size_t>(0, held.size())].set("Email", text); break;
+        case 2: chosen.remove(key); break;
+        case 3: chosen.set(key, Dictionary{{"Email", text}}); break;
+        case 4: chosen.dictionaryFor(key).remove("Email"); break;
+        case 5: chosen.dictionaryFor(key).arrayFor("list").append(text); break;
+        case 6: chosen.set(key, all.front()["p3"].isDictionary() ? all.front()["p3"] : Value(text)); break;
+        default: all.push_back(Value(chosen).deepMutableCopy().dictionary()); break;
+        }
+        const auto bytesOf = [](const Value& v) { return BinaryValue::encode(v); };
+        for (const Dictionary& a : all)
+            for (const Dictionary& b : all) RC_ASSERT((a == b) == (bytesOf(a) == bytesOf(b)));
+    }
+}
+
 TEST(ValueTest, IntegersAndRealsAreEqualWhenTheirNumbersAreExactly) {
     EXPECT_EQ(Value(2), Value(2.0));
     EXPECT_NE(Value(2), Value(2.5));
