@@ -1,5 +1,7 @@
 #include "engine/EngineCollaborators.h"
+#include "engine/pass/OutOfOrderWork.h"
 #include "store/dav/CXDAVManager.h"
+#include "store/http/StoreDistance.h"
 
 #include <utility>
 
@@ -13,7 +15,9 @@ public:
         std::string user = CXDAVManager::vaultraUser();
         return user.empty() ? std::nullopt : std::optional(UserName(std::move(user)));
     }
+    // Behind a long way nobody waits for a worker that waits for the store, so that as many are used as there may be.
     Value configValueForKey(const std::string& key, Value defaultValue) const override {
+        if (key == kThreadCountKey && isStoreFar(CXDAVManager::defaultManager())) defaultValue = kMostWorkers;
         return CXDAVManager::configValueForKey(key, std::move(defaultValue));
     }
     void updateConfigDataIfNeeded() override { CXDAVManager::updateConfigDataIfNeeded(); }

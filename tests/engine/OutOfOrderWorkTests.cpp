@@ -87,6 +87,23 @@ TEST_F(Workers, AreTenAtMost) {
     EXPECT_EQ(world.vaultra->threads(), 10u);
 }
 
+TEST_F(Workers, BecomeMoreWhileTheyWorkWhenMoreAreWantedThen) {
+    Gate first(3), all(10);
+    std::atomic<int> calls{0};
+    world.vaultra->whenApplying = [&](const CXDChangeRecordPtr&, bool*) {
+        const int call = ++calls;
+        if (call == 1) world.account.threads = 10; // as of a store that turns out to be far
+        if (call <= 3)
+            first.pass();
+        else if (call <= 13)
+            all.pass();
+        return true;
+    };
+    world.engine->applyChangeRecords(updates(40));
+    EXPECT_EQ(world.vaultra->threads(), 10u);
+    EXPECT_EQ(world.progress.did, 40);
+}
+
 TEST_F(Workers, AreNoMoreThanTheRecords) {
     EngineParts parts(world.collaborators());
     parts.conduits = parts.with.makeConduits(*world.engine);

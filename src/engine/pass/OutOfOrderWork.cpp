@@ -8,6 +8,7 @@
 #include "foundation/Mutex.h"
 
 #include <algorithm>
+#include <bit>
 #include <charconv>
 #include <iterator>
 #include <system_error>
@@ -17,9 +18,7 @@ namespace rolvane {
 
 namespace {
 constexpr double kIdleSeconds = 1.0; // a worker that gets nothing for so long ends
-constexpr const char* kThreadCountKey = "CXDThreadCountKey";
 constexpr int64_t kDefaultWorkers = 3;
-constexpr int64_t kMostWorkers = 10;
 constexpr double kTerminationGlance = 0.2; // how often a wait without workers looks whether the process is to end
 } // namespace
 
@@ -44,21 +43,36 @@ OutOfOrderWork::~OutOfOrderWork() {
 }
 
 void OutOfOrderWork::start(int64_t workers) {
+    _outOfOrderLock.lock();
+    addWorkers(workers);
+    _workHere = _workers.empty() && workers > 0 && _changeCount > 0;
+    _hasWorkers = !_workers.empty();
+    _outOfOrderLock.unlock();
+}
+
+void OutOfOrderWork::addWorkers(int64_t workers) {
     const int64_t count = std::min(workers, static_cast<int64_t>(_changeCount));
-    for (int64_t i = 0; i < count; ++i) {
+    while (static_cast<int64_t>(_workers.size()) < count) {
         try {
             _workers.emplace_back([this] { outOfOrderWorkLoop(); });
         } catch (const std::system_error& e) {
             CXLog("Only %d of %d workers could be started: %s", _workers.size(), count, e.what());
-            _workHere = _workers.empty();
             return;
         }
     }
 }
 
+// How many there are to be may depend on how far the store is, which its first answers tell.
+void OutOfOrderWork::addWorkersIfWanted() {
+    const int64_t wanted = configuredWorkers(_parts.with.account);
+    _outOfOrderLock.lock();
+    if (!_records.empty() && _hasWorkers) addWorkers(wanted);
+    _outOfOrderLock.unlock();
+}
+
 void OutOfOrderWork::wait() {
     if (_workHere) outOfOrderWorkLoop();
-    if (!_workers.empty() || _changeCount == 0) {
+    if (_hasWorkers || _changeCount == 0) {
         _outOfOrderLock.lockWhenCondition(1);
     } else {
         while (!_outOfOrderLock.lockWhenCondition(1, kTerminationGlance))
@@ -75,7 +89,7 @@ void OutOfOrderWork::finish() {
     CXDChangeRecords untouched(_records.begin(), _records.end());
     _records.clear();
     _outOfOrderLock.unlockWithCondition(0);
-    for (std::thread& worker : _workers) worker.join();
+    for (std::thread& worker : _workers) worker.join(); // nobody adds one where nothing is left
     _records.assign(untouched.begin(), untouched.end());
 }
 
@@ -178,13 +192,14 @@ void OutOfOrderWork::cancelLike(const CXDChangeRecordPtr& record) {
 
 void OutOfOrderWork::report(const CXDChangeRecordPtr& record) {
     _outOfOrderLock.lock();
-    ++_processedCount;
+    const bool isTimeToLook = std::has_single_bit(++_processedCount); // seldom, as it reads the preferences
     try {
         _parts.with.progress.didProcessChangeRecord(record);
     } catch (const CXException& e) {
         CXLog("Progress of a change record could not be reported: %@", e);
     }
     _outOfOrderLock.unlockWithCondition(_processedCount == _changeCount ? 1 : 0);
+    if (isTimeToLook) addWorkersIfWanted();
 }
 
 } // namespace rolvane

@@ -13,7 +13,11 @@
 
 namespace rolvane {
 
-// How many workers a pass may have: a number, or a text that is one; 3 unless configured otherwise, 10 at most.
+inline constexpr const char* kThreadCountKey = "CXDThreadCountKey";
+inline constexpr int64_t kMostWorkers = 10;
+
+// How many workers a pass may have: a number, or a text that is one; 3 unless configured otherwise, 10 at most. To a
+// store that is far the network's account gives 10 where nothing is configured.
 int64_t configuredWorkers(const NetworkAccount& account);
 
 // The records of one pass that may be applied in any order, and the workers that apply them while the main thread
@@ -28,7 +32,7 @@ public:
     ~OutOfOrderWork(); // finishes
 
     // As many threads as asked for, at most one a record; none for zero or less. When the system gives no thread at
-    // all, `wait` does the work itself.
+    // all, `wait` does the work itself. While they work there may become more, as `configuredWorkers` says then.
     void start(int64_t workers);
     // Returns when every record has been handled; the lock is held from then on. Without workers and with records it
     // never returns, unless the process is asked to end.
@@ -37,7 +41,7 @@ public:
     void finish() NO_THREAD_SAFETY_ANALYSIS;
 
     size_t processedCount() const NO_THREAD_SAFETY_ANALYSIS { return _processedCount; } // after wait
-    size_t workers() const { return _workers.size(); }
+    size_t workers() const NO_THREAD_SAFETY_ANALYSIS { return _workers.size(); } // before and after they are at work
     // Once nobody works any more nothing guards them.
     const CXDChangeRecords& pending() const NO_THREAD_SAFETY_ANALYSIS { return _pending; }
     CXDChangeRecords takePending() NO_THREAD_SAFETY_ANALYSIS;   // after finish
@@ -49,6 +53,8 @@ private:
     bool applyTo(CXDConduit& conduit, int32_t source, const CXDChangeRecordPtr& record, bool& denied);
     void cancelLike(const CXDChangeRecordPtr& record);
     void report(const CXDChangeRecordPtr& record);
+    void addWorkers(int64_t workers) REQUIRES(_outOfOrderLock);
+    void addWorkersIfWanted();
 
     EngineParts& _parts;
     RecordTurns _turns;
@@ -60,7 +66,8 @@ private:
     const size_t _changeCount;
     Mutex _processedChangesLock;
     CXDChangeRecords _pending GUARDED_BY(_processedChangesLock);
-    std::vector<std::thread> _workers;
+    std::vector<std::thread> _workers GUARDED_BY(_outOfOrderLock);
+    bool _hasWorkers = false; // from the start
     bool _workHere = false;
     bool _lockHeld = false; // by the main thread, after wait
     bool _finished = false;

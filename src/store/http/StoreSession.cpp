@@ -180,9 +180,16 @@ bool StoreSession::signIn() {
     return true;
 }
 
+HttpResponse StoreSession::timed(HttpRequest request) {
+    const auto began = std::chrono::steady_clock::now();
+    HttpResponse answer = _transport->perform(std::move(request));
+    if (answer.complete()) _distance.answered(std::chrono::steady_clock::now() - began);
+    return answer;
+}
+
 HttpResponse StoreSession::performed(HttpRequest request) {
     const HttpRequest asked = request;
-    return followed(asked, _transport->perform(std::move(request)));
+    return followed(asked, timed(std::move(request)));
 }
 
 HttpResponse StoreSession::followed(const HttpRequest& asked, HttpResponse answer) {
@@ -260,7 +267,7 @@ void StoreSession::noteFailure(std::string_view method, const Url& url, const Ht
 
 HttpResponse StoreSession::send(HttpRequest request, Handled handled) {
     const HttpRequest asked = request;
-    return judged(asked, signIn() ? _transport->perform(std::move(request)) : unsent(), handled);
+    return judged(asked, signIn() ? timed(std::move(request)) : unsent(), handled);
 }
 
 HttpResponse StoreSession::sendUnnoted(HttpRequest request) {
@@ -270,15 +277,22 @@ HttpResponse StoreSession::sendUnnoted(HttpRequest request) {
 
 std::vector<HttpResponse> StoreSession::sendAll(std::vector<HttpRequest> requests, Handled handled) {
     const std::vector<HttpRequest> asked = requests;
+    const bool isSignedIn = signIn();
+    const auto began = std::chrono::steady_clock::now();
     auto answers =
-        signIn() ? _transport->performAll(std::move(requests)) : std::vector<HttpResponse>(requests.size(), unsent());
+        isSignedIn ? _transport->performAll(std::move(requests)) : std::vector<HttpResponse>(requests.size(), unsent());
+    if (!answers.empty() && answers.front().complete()) _distance.answered(std::chrono::steady_clock::now() - began);
     for (size_t i = 0; i < answers.size(); ++i) answers[i] = judged(asked[i], std::move(answers[i]), handled);
     return answers;
 }
 
 void StoreSession::start(HttpRequest request, HttpTransport::Completion done) {
-    if (signIn()) return _transport->start(std::move(request), std::move(done));
-    done(unsent());
+    if (!signIn()) return done(unsent());
+    _transport->start(std::move(request),
+                      [this, began = std::chrono::steady_clock::now(), done = std::move(done)](HttpResponse answer) {
+                          if (answer.complete()) _distance.answered(std::chrono::steady_clock::now() - began);
+                          done(std::move(answer));
+                      });
 }
 
 HttpResponse StoreSession::options() {

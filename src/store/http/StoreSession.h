@@ -5,6 +5,7 @@
 #include "store/dav/CXDAVManager.h"
 #include "store/http/HttpTransport.h"
 #include "store/http/RequestFailures.h"
+#include "store/http/StoreDistance.h"
 
 #include <atomic>
 #include <chrono>
@@ -90,9 +91,12 @@ public:
     static std::string pathOfHref(const std::string& href);
     static HttpRequest propfind(Url url, int depth, bool withMembersTags = false);
 
+    bool isFar() const { return _distance.isFar(); } // by the answers so far
+
 private:
     bool signIn();
     bool isDavServer();
+    HttpResponse timed(HttpRequest request);
     HttpResponse performed(HttpRequest request);
     HttpResponse followed(const HttpRequest& asked, HttpResponse answer);
     HttpResponse believed(const HttpRequest& asked, HttpResponse answer);
@@ -111,6 +115,7 @@ private:
     CurlTransport* const _signsIn; // gets the credentials; none when the transport has its own
 
     RequestFailures _failures;
+    StoreDistance _distance;
 
     Mutex _mutex;
     std::optional<std::string> _password GUARDED_BY(_mutex);

@@ -1,0 +1,11 @@
+#include "store/http/StoreDistance.h"
+
+#include "store/dav/CXDAVManagerImpl.h"
+
+namespace rolvane {
+
+bool isStoreFar(const CXDAVManager& manager) {
+    return manager.impl()->session.isFar();
+}
+
+} // namespace rolvane
