@@ -309,7 +309,7 @@ TEST(HistoryOfTheFormatBefore, BeginsWithTheFirstOpening) {
     d->recordForUniqueId(UniqueId("A:CXPerson"))->setValue("x", kCXNoteProperty);
     d->save();
     EXPECT_EQ(CXHistory(*d).latest(10).size(), 1U);
-    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 8);
+    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 9);
 }
 
 } // namespace

@@ -5,6 +5,7 @@
 #include "foundation/Sqlite.h"
 
 #include <filesystem>
+#include <fstream>
 
 namespace rolvane::test {
 namespace {
@@ -47,6 +48,28 @@ TEST(DaemonMemory, KeepsTheMemoryWithTheDatabaseAndLeavesWhatAPersonSets) {
     d.put(kQueue, Value());
     EXPECT_FALSE(d.seenByAnother(kQueue));
     EXPECT_EQ(d.rows(kQueue), 0);
+}
+
+// The states of many people are megabytes, and each pass reads some dates that lie among them.
+TEST(DaemonMemory, ASmallValueIsFoundWithoutReadingTheLargeOnesBesideIt) {
+    Remembered d;
+    constexpr size_t kLarge = 4u << 20;
+    for (const char* key : {"CXDConduitData/CXDCX/ann/G1", "CXDConduitData/CXDVaultra/ann/G1", "CXDPendingChanges"})
+        d.preferences.set(kDaemonDomain, key, Bytes(kLarge, 7));
+    d.put("CXDCXConduitLastSyncDate", 1);
+    d.put("CXDShareCount", 2);
+    const Preferences another(d.preferencesPath, daemonMemory(d.path));
+    const auto bytesRead = [] {
+        std::ifstream counts("/proc/self/io");
+        std::string name;
+        uint64_t bytes = 0;
+        counts >> name >> bytes; // "rchar:"
+        return bytes;
+    };
+    const uint64_t before = bytesRead();
+    EXPECT_EQ(another.get(kDaemonDomain, "CXDShareCount"), Value(2));
+    EXPECT_EQ(another.get(kDaemonDomain, "CXDCXConduitLastSyncDate"), Value(1));
+    EXPECT_LT(bytesRead() - before, kLarge / 4);
 }
 
 TEST(DaemonMemory, ACopyOfTheDatabaseHasTheMemoryThatFitsIt) {

@@ -1,5 +1,6 @@
 #include "TestDatabase.h"
 
+#include "contacts/database/DaemonMemory.h"
 #include "foundation/Sqlite.h"
 
 #include <csignal>
@@ -15,11 +16,11 @@ namespace {
 TEST(DatabaseFault, AFileOfANewerFormatIsRefusedAndLeftAlone) {
     TestDatabase d;
     d.database.reset();
-    Sqlite(d.path, 0).execute("PRAGMA user_version=9");
+    Sqlite(d.path, 0).execute("PRAGMA user_version=10");
     std::string told = reasonOf([&] { d.open(); });
     EXPECT_TELLS(told, "newer version");
     EXPECT_TELLS(told, d.path);
-    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 9);
+    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 10);
 }
 
 TEST(DatabaseFault, AFileOfTheFormerFormatLearnsWhoWroteWhat) {
@@ -35,7 +36,7 @@ TEST(DatabaseFault, AFileOfTheFormerFormatLearnsWhoWroteWhat) {
     d->save();
     EXPECT_EQ(d->personRow(UniqueId("A:CXPerson"))->writer, "rolvane");
     d.database.reset();
-    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 8);
+    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 9);
 }
 
 TEST(DatabaseFault, AFileOfTheFormatBeforeNamesItsGroupsMembers) {
@@ -50,7 +51,7 @@ TEST(DatabaseFault, AFileOfTheFormatBeforeNamesItsGroupsMembers) {
     EXPECT_EQ(friends->memberUniqueIds(), std::vector{UniqueId("A:CXPerson")});
     EXPECT_EQ(friends->memberCount(), 1u);
     d.database.reset();
-    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 8);
+    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 9);
 }
 
 TEST(DatabaseFault, AFileOfTheFormatBeforeKeepsWhatEditedContactsWere) {
@@ -68,7 +69,7 @@ TEST(DatabaseFault, AFileOfTheFormatBeforeKeepsWhatEditedContactsWere) {
     d->save();
     EXPECT_EQ(d->editedSinceCommon(), std::vector{ada});
     d.database.reset();
-    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 8);
+    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 9);
 }
 
 TEST(DatabaseFault, AFileOfTheFormatBeforeFindsPeopleByTheirNames) {
@@ -91,7 +92,26 @@ TEST(DatabaseFault, AFileOfTheFormatBeforeFindsPeopleByTheirNames) {
         d->rollback();
     }
     d.database.reset();
-    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 8);
+    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 9);
+}
+
+TEST(DatabaseFault, AFileOfTheFormatBeforeKeepsTheDaemonsMemory) {
+    TestDatabase d;
+    d.database.reset();
+    Sqlite(d.path, 0).execute("DROP TABLE daemon; "
+                              "CREATE TABLE daemon(key TEXT PRIMARY KEY, value BLOB NOT NULL) WITHOUT ROWID; "
+                              "INSERT INTO daemon VALUES('CXDShareCount', x'01'), ('CXDConduitData', x'02'); "
+                              "PRAGMA user_version=8");
+    d.database = d.open("rolvane");
+    Sqlite file(d.path, 0);
+    MemoryTable memory(file);
+    EXPECT_EQ(memory.keys(), (std::vector<std::string>{"CXDConduitData", "CXDShareCount"}));
+    EXPECT_EQ(memory.value("CXDShareCount"), Bytes{1});
+    EXPECT_EQ(memory.value("CXDConduitData"), Bytes{2});
+    memory.write({{"CXDShareCount", Bytes{3}}, {"CXDConduitData", std::nullopt}});
+    EXPECT_EQ(memory.value("CXDShareCount"), Bytes{3});
+    EXPECT_EQ(memory.keys(), std::vector<std::string>{"CXDShareCount"});
+    EXPECT_EQ(file.integer("PRAGMA user_version"), 9);
 }
 
 TEST(DatabaseFault, AnotherProgramsFileIsRefusedAndLeftAlone) {

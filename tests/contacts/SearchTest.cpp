@@ -107,7 +107,7 @@ TEST_F(WordSearch, AFileOfTheFormatBeforeIsSearchedByNotesToo) {
     d.database = d.open();
     EXPECT_EQ(found("zurich +49 170 1234567"), Names{"Ada"});
     d.database.reset();
-    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 8);
+    EXPECT_EQ(Sqlite(d.path, 0).integer("PRAGMA user_version"), 9);
 }
 
 TEST_F(WordSearch, PeopleWhoseNameBeginsSoAreGivenUpToANumber) {

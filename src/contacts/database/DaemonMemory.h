@@ -17,8 +17,10 @@ class MemoryTable {
 public:
     explicit MemoryTable(Sqlite& database) : _database(database) {}
 
+    // The keys have an index of their own: SQLite reads whatever lies beside the keys that it passes on its way to one,
+    // and a state of many people takes megabytes.
     static constexpr const char* kTable = R"(
-CREATE TABLE IF NOT EXISTS daemon(key TEXT PRIMARY KEY, value BLOB NOT NULL) WITHOUT ROWID;
+CREATE TABLE IF NOT EXISTS daemon(key TEXT NOT NULL PRIMARY KEY, value BLOB NOT NULL);
 )";
 
     static bool hasKey(std::string_view key); // is the key of the daemon's domain one of the table's?

@@ -25,7 +25,7 @@ namespace rolvane {
 
 namespace {
 
-constexpr int kFormat = 8;
+constexpr int kFormat = 9;
 constexpr int64_t kApplicationId = 0x52564c43; // "RVLC"
 
 constexpr const char* kTables = R"(
@@ -170,6 +170,7 @@ void RecordStore::makeOrCheckFormat() {
     if (format == 5) format = addDaemonMemory();
     if (format == 6) format = addSearchTexts();
     if (format == 7) format = addChangeLog();
+    if (format == 8) format = moveDaemonMemory();
     if (format > kFormat)
         throw CXException(kCXDatabaseException, "The contact database " + _database.path() +
                                                     " was written by a newer version (format " +
@@ -254,6 +255,17 @@ int64_t RecordStore::addChangeLog() {
     SqliteTransaction transaction(_database);
     if (_database.integer("PRAGMA user_version") == 7) // nobody else did it meanwhile
         _database.execute(std::string(ChangeLog::kTable) + "PRAGMA user_version=8;");
+    transaction.commit();
+    return _database.integer("PRAGMA user_version");
+}
+
+// Up to format 8 the values of the daemon's memory lay among its keys.
+int64_t RecordStore::moveDaemonMemory() {
+    SqliteTransaction transaction(_database);
+    if (_database.integer("PRAGMA user_version") == 8) // nobody else did it meanwhile
+        _database.execute(std::string("ALTER TABLE daemon RENAME TO former_daemon;") + MemoryTable::kTable +
+                          "INSERT INTO daemon SELECT key, value FROM former_daemon; DROP TABLE former_daemon; "
+                          "PRAGMA user_version=9;");
     transaction.commit();
     return _database.integer("PRAGMA user_version");
 }

@@ -140,6 +140,7 @@ private:
     int64_t addDaemonMemory();
     int64_t addSearchTexts();
     int64_t addChangeLog();
+    int64_t moveDaemonMemory();
     void fillNewDatabase();
     [[noreturn]] void outOfOrder();
     std::vector<CXRow> rowsWithParents(Sqlite::Statement& s, int positionColumn, int64_t& position);
