@@ -60,7 +60,7 @@ struct GroupStore {
                 return answerOf(200, {{"etag", tag}},
                                 "<plist version=\"1.0\"><dict><key>version</key><integer>" + std::to_string(version) +
                                     "</integer></dict></plist>");
-            const std::string tree = "/dav/alice/Contacts";
+            const std::string path = r.url.encodedPath(), tree = path.substr(0, path.find("/Contacts")) + "/Contacts";
             if (r.url.encodedPath().find("People") != std::string::npos) return answerOf(404);
             return answerOf(207, {{"date", "Tue, 14 Nov 2023 22:15:00 GMT"}},
                             "<D:multistatus xmlns:D=\"DAV:\">" + response(tree + "/", "<D:collection/>", "") +
@@ -79,16 +79,16 @@ struct GroupStore {
 class Process {
 public:
     Process(GroupStore& store, const std::string& directory, const std::string& user = "alice")
-        : _manager(account(user), store.wire(), CXDAVManager::VersionsFile{directory + "/versions"}),
-          _tree(_manager.account().baseLocationFor(UserName("alice"))) {
+        : _manager(account(user), store.wire(), CXDAVManager::VersionsFile{directory + "/versions"}) {
         CXDAVError error;
         EXPECT_TRUE(_manager.canReach(error)) << error.reason;
         _manager.useVersionMemoryOf("database", 1);
     }
-    int64_t groupSays() {
+    int64_t groupSays(const std::string& owner = "alice") {
         const CXDAVManager::Snapshot snapshot(_manager);
-        EXPECT_TRUE(_manager.infoForFilesInContainer(_tree));
-        const auto content = _manager.dictionaryAtURL(_tree.cxURLByAppendingComponent("1:CXGroup"), nullptr, false);
+        const Url tree = _manager.account().baseLocationFor(UserName(owner));
+        EXPECT_TRUE(_manager.infoForFilesInContainer(tree));
+        const auto content = _manager.dictionaryAtURL(tree.cxURLByAppendingComponent("1:CXGroup"), nullptr, false);
         return content ? (*content)["version"].integer() : -1;
     }
     void save() { _manager.saveVersionMemory("database", 1); }
@@ -103,7 +103,6 @@ private:
         return a;
     }
     CXDAVManager _manager;
-    const Url _tree;
 };
 
 } // namespace
@@ -288,6 +287,25 @@ TEST(ListingMemory, IsWorthSavingWithANewTreeAndThenWithATenthOfChanges) {
     EXPECT_TRUE(memory.isWorthSaving(false));
 }
 
+TEST(ListingMemory, IsWorthSavingAtTheEndWhileItHasATreeThatNobodyAsksForAnyMore) {
+    const Url other = *Url::parse("http://store.example.org/carol/Contacts");
+    ListingMemory memory;
+    for (const Url& tree : {kTree, other}) {
+        memory.keep(tree, ListingMemory::kSynced, entriesBelow(tree, 3, 1));
+        memory.keepToken(tree, "1");
+    }
+    ListingMemory next;
+    ASSERT_TRUE(next.restore(memory.saved()));
+    EXPECT_FALSE(next.isWorthSaving(true)) << "nothing was asked";
+    next.keepToken(kTree, "1", std::vector<std::string>());
+    EXPECT_FALSE(next.isWorthSaving(false));
+    EXPECT_TRUE(next.isWorthSaving(true));
+    ListingMemory last;
+    ASSERT_TRUE(last.restore(next.saved()));
+    EXPECT_EQ(last.token(kTree), "1");
+    EXPECT_EQ(last.token(other), "");
+}
+
 TEST(GroupCopies, OfAProcessThatHasEndedAreNotReadAgain) {
     TempHome home;
     GroupStore store;
@@ -306,6 +324,34 @@ TEST(GroupCopies, OfAProcessThatHasEndedAreNotReadAgain) {
     Process stranger(store, home.path(), "bob");
     EXPECT_EQ(stranger.groupSays(), 1);
     EXPECT_EQ(store.asked["GET"], 2) << "another account reads for itself";
+}
+
+TEST(GroupCopies, OfATreeThatIsNotReadAnyMoreLeaveTheFile) {
+    TempHome home;
+    GroupStore store;
+    const auto isInTheFile = [&](const char* owner) {
+        return readFile(home.path() + "/groups").find(std::string("/") + owner + "/Contacts/") != std::string::npos;
+    };
+    {
+        Process first(store, home.path());
+        EXPECT_EQ(first.groupSays("alice"), 1);
+        EXPECT_EQ(first.groupSays("carol"), 1);
+        first.save();
+        first.end();
+    }
+    EXPECT_TRUE(isInTheFile("alice"));
+    EXPECT_TRUE(isInTheFile("carol"));
+    {
+        Process away(store, home.path()); // and has looked at nothing
+        away.end();
+    }
+    EXPECT_TRUE(isInTheFile("carol"));
+    Process second(store, home.path());
+    EXPECT_EQ(second.groupSays("alice"), 1);
+    second.end();
+    EXPECT_TRUE(isInTheFile("alice"));
+    EXPECT_FALSE(isInTheFile("carol"));
+    EXPECT_EQ(store.asked["GET"], 2);
 }
 
 TEST(GroupCopies, OfAnotherVersionAreReadAgain) {

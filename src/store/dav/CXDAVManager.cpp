@@ -93,6 +93,16 @@ void CXDAVManager::Impl::saveListings(bool atEnd) {
     listings().wasSaved();
 }
 
+void CXDAVManager::Impl::sawTree(const Url& tree) {
+    const Lock guard(_treesLock);
+    _trees.insert(tree.absoluteString() + "/");
+}
+
+void CXDAVManager::Impl::forgetOtherTrees() {
+    const Lock guard(_treesLock);
+    if (!_trees.empty()) copies().keepOnly(_trees);
+}
+
 StoreFiles::Reading CXDAVManager::Impl::read(const Url& name, bool securely) {
     const auto endsATree = [](int code) { return code == 403 || code == 404; };
     StoreFiles::Reading once = files.read(name, securely);
@@ -265,6 +275,7 @@ std::optional<FileListing> CXDAVManager::infoForFilesInContainer(const Url& url)
 std::optional<FileListing> CXDAVManager::infoForFilesInContainerByParts(const Url& url, const ListingPart& part) {
     auto listing = StoreListing(_impl->session, _impl->versions, _impl->listings()).list(url, _impl->begun(url), part);
     if (!listing) return listing;
+    _impl->sawTree(url);
     for (const auto& [path, file] : *listing) {
         if (!file.displayName.ends_with("CXGroup")) continue;
         const Url group = url.cxURLByAppendingComponent(file.displayName);
@@ -332,6 +343,7 @@ std::optional<CXDAVManager::TreeMark> CXDAVManager::markOfTree(const Url& tree, 
         StoreListing::AskedRef begun = _impl->begun(tree);
         if (!StoreListing(_impl->session, _impl->versions, _impl->listings()).bringUpToDate(tree, begun))
             return std::nullopt;
+        _impl->sawTree(tree);
         const Lock guard(_impl->begunLock);
         _impl->begunListings.insert_or_assign(tree.absoluteString(), std::move(begun));
     }
@@ -397,6 +409,7 @@ void CXDAVManager::revertVersionMemory() {
 void CXDAVManager::processEnds() const noexcept try {
     if (!_impl->isOfDaemon) return;
     _impl->saveListings(true);
+    _impl->forgetOtherTrees();
     if (!_impl->copies().hasChanged()) return;
     _impl->groupFile.write(
         _impl->copies().saved([this](const std::string& name) { return _impl->versions.markOf(name); }));

@@ -13,6 +13,8 @@
 
 #include <atomic>
 #include <map>
+#include <set>
+#include <string>
 
 namespace rolvane {
 
@@ -45,7 +47,13 @@ struct CXDAVManager::Impl {
     std::map<std::string, StoreListing::AskedRef> begunListings GUARDED_BY(begunLock); // by container
     StoreListing::AskedRef begun(const Url& container); // hands it out; null when there is none
 
+    // The trees that were looked at in this process.
+    void sawTree(const Url& tree);
+    void forgetOtherTrees(); // copies of groups
+
 private:
+    Mutex _treesLock;
+    std::set<std::string> _trees GUARDED_BY(_treesLock); // each with its "/"
     ListingMemory _listings;
     const CacheFile _listingFile;
     std::once_flag _listingsRead, _copiesRead;

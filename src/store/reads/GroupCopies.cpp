@@ -32,6 +32,14 @@ void GroupCopies::forgetAll() {
     _hasChanged = true;
 }
 
+void GroupCopies::keepOnly(const std::set<std::string>& trees) {
+    const auto isOfAnother = [&](const auto& copy) {
+        return !trees.contains(copy.first.substr(0, copy.first.rfind('/') + 1));
+    };
+    const Lock guard(_mutex);
+    _hasChanged = std::erase_if(_copies, isOfAnother) + std::erase_if(_former, isOfAnother) > 0 || _hasChanged;
+}
+
 void GroupCopies::beginSnapshot() {
     const Lock guard(_mutex);
     _unchanged.clear();

@@ -7,6 +7,7 @@
 #include <cstddef>
 #include <functional>
 #include <optional>
+#include <set>
 #include <string>
 #include <unordered_map>
 #include <unordered_set>
@@ -23,6 +24,8 @@ public:
     void keep(const std::string& name, const Dictionary& content);
     void forget(const std::string& name);
     void forgetAll();
+    // Those of other trees than these (each with its "/") go. They were read once, and nobody asks for them any more.
+    void keepOnly(const std::set<std::string>& trees);
 
     // A snapshot begins and ends; what was found unchanged counts only in between.
     void beginSnapshot();

@@ -5,7 +5,7 @@
 
 #include <algorithm>
 #include <cstring>
-#include <set>
+#include <numeric>
 #include <utility>
 
 namespace rolvane {
@@ -61,32 +61,63 @@ void ListingMemory::compact(Container& container) {
     container.unused = 0;
 }
 
+std::span<const uint32_t> ListingMemory::rowsNamed(Container& container, std::string_view encodedName) {
+    std::vector<uint32_t>& order = container.order;
+    const auto name = [&](uint32_t row) { return nameOf(container, container.rows[row]); };
+    if (order.size() != container.rows.size()) {
+        order.resize(container.rows.size());
+        std::iota(order.begin(), order.end(), uint32_t{0});
+        std::stable_sort(order.begin(), order.end(), [&](uint32_t a, uint32_t b) { return name(a) < name(b); });
+    }
+    const auto first = std::lower_bound(order.begin(), order.end(), encodedName,
+                                        [&](uint32_t row, std::string_view wanted) { return name(row) < wanted; });
+    auto last = first;
+    while (last != order.end() && name(*last) == encodedName) ++last;
+    return {first, last};
+}
+
+void ListingMemory::takeOut(Container& container, std::vector<size_t> places) {
+    if (places.empty()) return;
+    std::sort(places.begin(), places.end());
+    size_t rows = 0, next = 0;
+    for (size_t i = 0; i < container.rows.size(); ++i) {
+        const Row& row = container.rows[i];
+        if (next < places.size() && places[next] == i) {
+            container.unused += row.nameLength + row.tagLength;
+            ++next;
+        } else {
+            container.rows[rows++] = row;
+        }
+    }
+    container.rows.resize(rows);
+    container.order.clear();
+}
+
 bool ListingMemory::edit(const Url& container, const std::string& tag, const Edits& edits, const Told& told) {
     const Lock guard(_mutex);
     const auto found = _containers.find(container.absoluteString());
     if (tag.empty() || found == _containers.end() || found->second.tag != tag) return false;
     Container& kept = found->second;
     _bytes -= kept.bytes();
-    std::set<std::string_view> known; // of `edits`
-    size_t rows = 0;
-    for (Row& row : kept.rows) {
-        const auto edit = edits.find(nameOf(kept, row));
-        if (edit != edits.end()) {
-            const auto& [name, now] = *edit;
-            known.insert(name);
-            told(name, unpacked(kept, row).entry, now);
-            kept.unused += row.nameLength + row.tagLength;
-            if (!now) continue;
-            row = rowOf(kept.text, name, *now);
+    std::vector<size_t> gone;
+    std::vector<Edits::const_pointer> come;
+    for (const auto& edit : edits) {
+        const auto& [name, now] = edit;
+        const std::span<const uint32_t> places = rowsNamed(kept, name);
+        if (places.empty()) {
+            told(name, std::nullopt, now);
+            if (now) come.push_back(&edit);
+            continue;
         }
-        kept.rows[rows++] = row;
+        Row& row = kept.rows[places.front()];
+        told(name, unpacked(kept, row).entry, now);
+        gone.insert(gone.end(), places.begin() + (now ? 1 : 0), places.end());
+        if (!now) continue;
+        kept.unused += row.nameLength + row.tagLength;
+        row = rowOf(kept.text, name, *now);
     }
-    kept.rows.resize(rows);
-    for (const auto& [name, now] : edits) {
-        if (known.contains(name)) continue;
-        told(name, std::nullopt, now);
-        if (now) kept.rows.push_back(rowOf(kept.text, name, *now));
-    }
+    takeOut(kept, std::move(gone));
+    for (const auto* edit : come) kept.rows.push_back(rowOf(kept.text, edit->first, *edit->second));
     if (kept.unused > kept.text.size() / 2) compact(kept);
     _bytes += kept.bytes();
     if (_bytes > kMostBytes) {
@@ -102,10 +133,9 @@ std::optional<MultistatusEntry> ListingMemory::member(const Url& container, cons
     const Lock guard(_mutex);
     const auto found = _containers.find(container.absoluteString());
     if (tag.empty() || found == _containers.end() || found->second.tag != tag) return std::nullopt;
-    const Container& kept = found->second;
-    const auto row = std::find_if(kept.rows.begin(), kept.rows.end(),
-                                  [&](const Row& each) { return nameOf(kept, each) == encodedName; });
-    return row == kept.rows.end() ? std::nullopt : std::optional(unpacked(kept, *row).entry);
+    const std::span<const uint32_t> places = rowsNamed(found->second, encodedName);
+    if (places.empty()) return std::nullopt;
+    return unpacked(found->second, found->second.rows[places.front()]).entry;
 }
 
 ListingMemory::Member ListingMemory::unpacked(const Container& container, const Row& row) {
@@ -215,7 +245,10 @@ size_t ListingMemory::members() const {
 
 bool ListingMemory::isWorthSaving(bool atEnd) const {
     const Lock guard(_mutex);
-    return _isNew || (atEnd && _changes > 0) || (_changes > kFewChanges && _changes > members() / 10);
+    const auto isUsed = [](const auto& tree) { return tree.second.isUsed; };
+    const auto used = std::count_if(_tokens.begin(), _tokens.end(), isUsed);
+    const bool isLeft = used > 0 && static_cast<size_t>(used) < _tokens.size(); // by its reader
+    return _isNew || (atEnd && (_changes > 0 || isLeft)) || (_changes > kFewChanges && _changes > members() / 10);
 }
 
 void ListingMemory::wasSaved() {

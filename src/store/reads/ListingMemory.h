@@ -9,6 +9,7 @@
 #include <functional>
 #include <map>
 #include <optional>
+#include <span>
 #include <string>
 #include <string_view>
 #include <unordered_map>
@@ -47,7 +48,8 @@ public:
     Files filesChangedSince(const Url& tree, uint64_t state) const;
 
     // For a file (CacheFile.h). A token and the containers below its tree stay true together, however old they are. So
-    // they are worth saving when a tree has come, when a tenth of all members has changed, and when the process ends.
+    // they are worth saving when a tree has come, when a tenth of all members has changed, and when the process ends
+    // behind a change, or while there are trees that nobody asks for any more.
     void noteChanges(size_t members); // since they were saved
     bool isWorthSaving(bool atEnd) const;
     void wasSaved();
@@ -94,18 +96,22 @@ private:
     struct Container {
         std::string tag, text;
         std::vector<Row> rows;
-        size_t unused = 0; // bytes of the text that no row needs
-        size_t bytes() const { return text.size() + rows.size() * sizeof(Row); }
+        size_t unused = 0;           // bytes of the text that no row needs
+        std::vector<uint32_t> order; // numbers of the rows by their names, or empty until somebody looks one up
+        size_t bytes() const { return text.size() + rows.size() * (sizeof(Row) + sizeof(uint32_t)); }
     };
     static Member unpacked(const Container& container, const Row& row);
     static std::string_view nameOf(const Container& container, const Row& row);
     static Row rowOf(std::string& text, std::string_view encodedName, const MultistatusEntry& entry);
     static Container packed(const Entries& entries);
+    // Numbers of rows, until the rows change. Several only where a store lists a name twice.
+    static std::span<const uint32_t> rowsNamed(Container& container, std::string_view encodedName);
     static void compact(Container& container);
+    static void takeOut(Container& container, std::vector<size_t> places);
     size_t members() const REQUIRES(_mutex);
 
     mutable Mutex _mutex;
-    std::unordered_map<std::string, Container> _containers GUARDED_BY(_mutex);
+    mutable std::unordered_map<std::string, Container> _containers GUARDED_BY(_mutex); // their order comes late
     struct Synced {
         std::string token;
         uint64_t state = 0;
