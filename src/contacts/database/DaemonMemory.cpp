@@ -100,7 +100,8 @@ std::vector<std::string> MemoryTable::keys() {
 }
 
 void MemoryTable::write(const PreferencesChanges& changes) {
-    auto put = _database.statement("INSERT OR REPLACE INTO daemon VALUES(?, ?)");
+    // A value stays in its row, or row and index would be written elsewhere each time.
+    auto put = _database.statement("INSERT INTO daemon VALUES(?1, ?2) ON CONFLICT(key) DO UPDATE SET value=?2");
     auto erase = _database.statement("DELETE FROM daemon WHERE key=?");
     for (const auto& [key, bytes] : changes) {
         if (bytes)
