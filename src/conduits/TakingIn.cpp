@@ -30,8 +30,6 @@ void note(ConduitEngine& engine, const char* text) {
 bool isTakingIn(ConduitEngine& engine, const Preferences& preferences, CXRolvane& database) {
     if (!isOneOfSeveral(preferences) || !database.allGroup()->valueForProperty(kCXRemoteLocationProperty)) return false;
     if (noteOf(engine) == kReads) return true;
-    // Nothing of a tree counts as known while this computer publishes it again.
-    if (!engine.conduitObjectForKey(kConduitCX, kPublishAgain).empty()) return false;
     // The computer that has published the tree knows what was written there, before the tree was ever read.
     const Dictionary users = engine.conduitObjectForKey(kConduitVaultra, kPriorState);
     const Dictionary known = users[kSelf.str()].dictionary();

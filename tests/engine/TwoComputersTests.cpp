@@ -425,6 +425,41 @@ TEST_F(TwoComputers, ATreeWhoseListIsLostIsPublishedAgainThoughTheFirstPassesOfT
     expectEqual();
 }
 
+// The withdrawal is found out while the tree counts as lost. What was begun then is of a former publication.
+TEST_F(TwoComputers, WhoJoinsAgainTakesInFirstThoughItsFormerTreeWasBeingPublishedAgain) {
+    joinAndSettle();
+    std::filesystem::remove(world->file("AllCXGroup"));
+    const auto fails = std::make_shared<std::atomic<bool>>(true);
+    laptop.wire->intercept([fails](const HttpRequest& request) -> std::optional<HttpResponse> {
+        return *fails && request.method == "PUT" ? std::optional(answerOf(503)) : std::nullopt;
+    });
+    laptop.pass();
+    laptop.pass();
+    EXPECT_NE(log.text().find("It is published again"), std::string::npos) << log.text();
+    std::filesystem::remove_all(world->file(""));
+    *fails = false;
+    for (Participant* each : {&laptop, &desk}) {
+        for (int pass = 0; pass < 3 && publishes(*each); ++pass) try {
+                each->pass();
+            } catch (const Ended&) { // nothing is left to be served
+            }
+        ASSERT_FALSE(publishes(*each)) << log.text();
+        each->start();
+    }
+    name(desk, people[0], "Adelheid");
+    desk.publish();
+    desk.pass();
+    desk.pass();
+    join(laptop);
+    laptop.wire->clear();
+    laptop.pass();
+    EXPECT_EQ(changesIn(laptop), "");
+    settle(5);
+    EXPECT_EQ(nameIn(laptop, people[0]), "Adelheid") << log.text();
+    expectEqual();
+    EXPECT_TRUE(laptop.engine->getPendingChanges().empty());
+}
+
 TEST_F(TwoComputers, ALostListIsMadeAnewAndNamesAllWhoLieThere) {
     joinAndSettle();
     const CXPersonRef dora = laptop.add("Dora"); // the other computer does not know her yet

@@ -7,6 +7,7 @@
 #include "conduits/database/ContactReader.h"
 #include "conduits/database/GroupComparison.h"
 #include "conduits/database/RemovalChanges.h"
+#include "conduits/store/StoreComparison.h"
 #include "contacts/database/CXRolvane.h"
 #include "contacts/database/DamagedDatabase.h"
 #include "contacts/records/Constants.h"
@@ -184,13 +185,17 @@ std::optional<CXDChangeRecords> CXDCXConduit::changesOfGroupNow(const UniqueId& 
     return capture.take();
 }
 
-// The owner's tree has lost what it held: nothing of it counts as known any more, so that all of it is new.
+// The owner's tree has lost what it held: nothing of it counts as known any more, so that all of it is new. Of several
+// computers each still knows which tree it is: another one may withdraw it meanwhile.
 bool CXDCXConduit::forgetWhatIsPublishedAgain() {
     Dictionary again = engine().conduitObjectForKey(kConduitCX, kPublishAgain);
     if (again.empty() || again[kSelf.str()].boolean()) return false;
     again.set(kSelf.str(), true);
-    for (const char* conduit : {kConduitCX, kConduitVaultra})
-        engine().conduitObjectForKey(conduit, kPriorState).remove(kSelf.str());
+    Dictionary onStore = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
+    const Value serial = onStore[kSelf.str()].dictionary()[kSerialNumber];
+    onStore.remove(kSelf.str());
+    if (_isOneOfSeveral && serial.isString()) onStore.set(kSelf.str(), Dictionary{{kSerialNumber, serial}});
+    engine().conduitObjectForKey(kConduitCX, kPriorState).remove(kSelf.str());
     return true;
 }
 

@@ -29,11 +29,7 @@ void CXDVaultraConduit::openAsOneOfSeveral() {
     _takesIn = _isOneOfSeveral && isTakingIn(engine(), _with.preferences, _with.rolvane);
     _takenIn.reset();
     const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
-    const bool isPublishedAgain = engine().conduitObjectForKey(kConduitCX, kPublishAgain)[kSelf.str()].boolean();
-    const Value serial = isPublishedAgain // so the state has none
-                             ? _with.preferences.get(kDaemonDomain, kCXDToldOfItself).dictionary()[kSerial]
-                             : users[kSelf.str()].dictionary()[kSerialNumber];
-    _ownTreeIsHeld = _isOneOfSeveral && (_takesIn || !hasTold(serial));
+    _ownTreeIsHeld = _isOneOfSeveral && (_takesIn || !hasTold(users[kSelf.str()].dictionary()[kSerialNumber]));
     const auto own = baseLocationForUser(realUserFromUser(kSelf));
     if (!_isOneOfSeveral || !own || !_ACLManagerMap) return;
     // Another computer may have changed the list. Changes of this one that wait are kept with what it knew.

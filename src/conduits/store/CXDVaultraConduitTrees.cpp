@@ -56,9 +56,10 @@ bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state)
     if (!known) return true;
     Dictionary prior = *known;
     if (isOwn && _takesIn) return takesIn(prior, state);
-    if (isOwn && !isMended(prior, state)) return false;
     const Value knownSerial = prior[kSerialNumber], serial = state[kSerialNumber];
-    if (!serial.isString() || (knownSerial.isString() && knownSerial != serial)) return true; // no tree, or another one
+    const bool isAnother = serial.isString() && knownSerial.isString() && knownSerial != serial;
+    if (isOwn && !(_isOneOfSeveral && isAnother) && !isMended(prior, state)) return false;
+    if (!serial.isString() || isAnother) return true; // no tree, or another one
     const IsHere isHere = [&](const UniqueId& name) { return _with.rolvane.recordForUniqueId(name) != nullptr; };
     const TreeCondition condition =
         isOwn ? treeCondition(prior, state, _lastSyncDate, isHere) : treeCondition(prior, state, std::nullopt);
@@ -234,7 +235,9 @@ void CXDVaultraConduit::takeNamesAloneOut(Dictionary prior, const Dictionary& st
 bool CXDVaultraConduit::isMended(const Dictionary& prior, const Dictionary& state) {
     const Dictionary again = engine().conduitObjectForKey(kConduitCX, kPublishAgain);
     if (again.empty()) return true;
-    if (isToBePublishedAgain()) return false;
+    // In the pass whose scan takes everything for new no list is known to be written yet.
+    const bool isBegun = !_isOneOfSeveral || prior.contains(std::string(layout::kAllGroup));
+    if (!isBegun || isToBePublishedAgain()) return false;
     engine().setConduitObjectForKey(kConduitCX, Dictionary(), kPublishAgain);
     if (somebodyMayWrite()) return true;
     _leftovers = removalOfLeftovers(prior, state);
