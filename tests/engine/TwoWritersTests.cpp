@@ -328,6 +328,28 @@ TEST_F(TwoWriters, AWritersNewContactIsKeptWhicheverHalfOfItIsLate) {
     for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
 }
 
+// Edits of somebody else's contacts that the store refuses do not stand in the copies alone.
+TEST_F(TwoWriters, WhatTheStoreRefusesAWriterIsTakenBackFromTheCopies) {
+    const CXGroupRef circle = circleOfBoth();
+    bob.copyOf(people[0])->setValue(Value("Bob's"), kCXFirstNameProperty);
+    copyOf(circle)->addMember(bob.copyOf(people[1]));
+    copyOf(circle)->setValue(Value("Bob's circle"), kCXGroupNameProperty);
+    bob.application->removeRecord(bob.copyOf(people[2]));
+    bob.application->save();
+    bob.wire->intercept([](const HttpRequest& request) {
+        const bool isWrite = request.method == "PUT" || request.method == "DELETE";
+        return isWrite ? std::optional(answerOf(403)) : std::nullopt;
+    });
+    for (int pass = 0; pass < 2; ++pass) bob.pass();
+    bob.wire->intercept({});
+    for (Participant* each : {&bob, &alice, &bob}) each->pass();
+    EXPECT_EQ(copies(), alice.view()) << log.text();
+    EXPECT_EQ(firstName(people[0]), Value("Ada")) << "nothing of it came to her";
+    EXPECT_EQ(circle->name(), "Circle");
+    EXPECT_TRUE(alice.application->recordForUniqueId(people[2]->uniqueId()));
+    for (Participant* each : {&alice, &bob}) expectQuietPass(*each);
+}
+
 // The store says 403 to a question in between, and takes every change.
 TEST_F(TwoWriters, ARefusedQuestionTakesNoChangeBack) {
     const CXGroupRef circle = circleOfBoth();
