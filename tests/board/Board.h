@@ -26,6 +26,7 @@ struct Work {
     // Tells of a case that went wrong.
     std::function<void(const std::string& name, const std::vector<std::string>& wrong)> failed;
     std::function<void(const std::string& line)> told = [](const std::string&) {}; // what else there is to say
+    std::vector<std::string> parts = {};                                           // to be left out; empty: all
 
     // True when the case with that number is this process's.
     bool isMine(size_t number) const { return number % every == stage.seed() % every && number / every % jobs == job; }

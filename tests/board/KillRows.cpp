@@ -26,6 +26,26 @@ bool killOnce(Work& work, const Scenario& scenario, size_t operation) {
     return true;
 }
 
+bool killWithNewOnes(Work& work, const Scenario& scenario, size_t operation, Behind behind) {
+    constexpr size_t kNewOnes = 4;
+    Stage& stage = work.stage;
+    const std::string stamp = "new" + std::to_string(operation);
+    const char itself = scenario.role;
+    stage.forgetStory();
+    stage.bringBack(scenario.name);
+    const auto makes = [&](worlds::Editor& editor) { editor.makePeople(kNewOnes); };
+    stage.edit(itself, makes, stamp);
+    const Ending ending = stage.pass(itself, killAt(static_cast<int64_t>(operation)));
+    if (ending.met == 0) return false;
+    const auto goesOn = [&](worlds::Editor& editor) {
+        behind == Behind::takesBack ? editor.takeBack(stamp) : editor.changePhoneOfThose(stamp);
+    };
+    stage.edit(itself, goesOn, "behind");
+    judge(work, scenario.name + " with new contacts, killed at " + std::to_string(operation), settlingOf(scenario),
+          ending);
+    return true;
+}
+
 // A pass of each scenario is ended before each operation, and after each answer.
 void killEverywhere(Work& work) {
     for (const Scenario& scenario : scenarios())

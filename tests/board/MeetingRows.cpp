@@ -114,12 +114,17 @@ worlds::Habits writing() {
 
 } // namespace
 
-bool meetOnce(Work& work, const Scenario& scenario, size_t write) {
+bool meetOnce(Work& work, const Scenario& scenario, size_t write, bool newOnes) {
+    constexpr size_t kNewOnes = 5;
     if (scenario.alone || scenario.role == 'r') return false;
     Stage& stage = work.stage;
     stage.forgetStory();
     stage.bringBack(scenario.name);
-    stage.edit(scenario.role, writing(), "m");
+    if (newOnes)
+        stage.edit(
+            scenario.role, [](worlds::Editor& editor) { editor.makePeople(kNewOnes); }, "m");
+    else
+        stage.edit(scenario.role, writing(), "m");
     Ending ending;
     std::optional<worlds::Deed> deed;
     {

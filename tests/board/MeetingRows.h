@@ -10,7 +10,8 @@ void calm(Work& work);
 
 // A contact is written on the store by somebody else, without asking for the lock, between a pass's reading it and its
 // writing it. One case: that write of a contact, counted from 0; false when the pass has fewer, or nobody else writes.
-bool meetOnce(Work& work, const Scenario& scenario, size_t write);
+// With `newOnes` the pass has new contacts to write, else edits of all kinds.
+bool meetOnce(Work& work, const Scenario& scenario, size_t write, bool newOnes = false);
 void meet(Work& work);
 
 } // namespace rolvane::board

@@ -41,15 +41,27 @@ FakeAnswer answerOf(const std::string& kind) {
     return FakeAnswer::status(std::stoi(kind), "no");
 }
 
+bool changes(const std::string& request) {
+    return !request.starts_with("GET") && !request.starts_with("PROPFIND") && !request.starts_with("OPTIONS") &&
+           !request.starts_with("HEAD") && !request.starts_with("REPORT");
+}
+
 // One request of a pass meets the fault.
 class Spoiled {
 public:
-    Spoiled(test::FaultyStore& store, size_t number, std::string kind) : _store(store) {
-        _store.set([this, number, kind = std::move(kind)](const FakeRequest& request) -> std::optional<FakeAnswer> {
+    // `often`: how many requests, from that number on.
+    Spoiled(test::FaultyStore& store, size_t number, std::string kind, Spoils spoils, size_t often = 1)
+        : _store(store) {
+        _store.set([this, number, spoils, often,
+                    kind = std::move(kind)](const FakeRequest& request) -> std::optional<FakeAnswer> {
             const bool loses = kind == "lost answer";
+            if (spoils == Spoils::listings && request.method == "OPTIONS") return withoutExtensions(request);
+            if (spoils == Spoils::writes && !changes(request.method)) return std::nullopt;
+            if (spoils == Spoils::listings && request.method != "PROPFIND") return std::nullopt;
             {
                 const std::lock_guard guard(_lock);
-                if (_count++ != number) return std::nullopt;
+                const size_t count = _count++;
+                if (count < number || count - number >= often) return std::nullopt;
                 _met = request.method + " " + request.target;
             }
             if (!loses) return answerOf(kind);
@@ -66,27 +78,32 @@ public:
     }
 
 private:
+    // The server is any WebDAV server, and tells nothing of its own.
+    FakeAnswer withoutExtensions(const FakeRequest& request) {
+        FakeAnswer answer = _store.handOn(request);
+        std::string& bytes = answer.pieces.front().bytes;
+        for (const std::string extension :
+             {"<http://rolvane.net/ns/sync-collection>", "<http://rolvane.net/ns/members-tag>"})
+            if (const size_t at = bytes.find(extension); at != std::string::npos)
+                bytes.replace(at, extension.size(), "<http://example.org/nothing>");
+        return answer;
+    }
     test::FaultyStore& _store;
     mutable std::mutex _lock; // guards the following
     size_t _count = 0;
     std::string _met;
 };
 
-bool changes(const std::string& request) {
-    return !request.starts_with("GET") && !request.starts_with("PROPFIND") && !request.starts_with("OPTIONS") &&
-           !request.starts_with("HEAD") && !request.starts_with("REPORT");
-}
-
 } // namespace
 
-bool spoilRequest(Work& work, const Scenario& scenario, size_t request, const std::string& kind) {
+bool spoilRequest(Work& work, const Scenario& scenario, size_t request, const std::string& kind, Spoils spoils) {
     Stage& stage = work.stage;
     stage.forgetStory();
     stage.bringBack(scenario.name);
     Ending ending;
     std::string met;
     {
-        const Spoiled spoiled(stage.entrance(), request, kind);
+        const Spoiled spoiled(stage.entrance(), request, kind, spoils);
         ending = stage.pass(scenario.role);
         met = spoiled.met();
     }
@@ -100,6 +117,30 @@ bool spoilRequest(Work& work, const Scenario& scenario, size_t request, const st
     judge(work,
           scenario.name + ", " + kind + " at request " + std::to_string(request) + " " + met.substr(0, met.find(' ')),
           settling, ending);
+    return true;
+}
+
+bool spoilNewOnes(Work& work, const Scenario& scenario, size_t write, const std::string& kind) {
+    constexpr size_t kNewOnes = 4;
+    Stage& stage = work.stage;
+    const std::string stamp = "new" + std::to_string(write);
+    stage.forgetStory();
+    stage.bringBack(scenario.name);
+    const auto makes = [](worlds::Editor& editor) { editor.makePeople(kNewOnes); };
+    stage.edit(scenario.role, makes, stamp);
+    Ending ending;
+    std::string met;
+    {
+        const Spoiled spoiled(stage.entrance(), write, kind, Spoils::writes, kMostRequests);
+        ending = stage.pass(scenario.role);
+        met = spoiled.met();
+    }
+    if (met.empty()) return false;
+    stage.tell("   FAULT " + kind + " from " + met + " on");
+    const auto takesBack = [&](worlds::Editor& editor) { editor.takeBack(stamp); };
+    stage.edit(scenario.role, takesBack, "back");
+    judge(work, scenario.name + " with new contacts, " + kind + " from write " + std::to_string(write) + " on",
+          settlingOf(scenario), ending);
     return true;
 }
 

@@ -1,12 +1,12 @@
 #include "SeededBugs.h"
 
 #include "ClockRows.h"
-#include "DamageRows.h"
-#include "DiskRows.h"
 #include "KillRows.h"
 #include "MeetingRows.h"
 #include "PowerRows.h"
 #include "RequestRows.h"
+
+#include <algorithm>
 
 namespace rolvane::board {
 
@@ -26,26 +26,22 @@ constexpr size_t kStride = 5;
 Hunt kills(const std::string& of) {
     return [of](Work& work, size_t number) { return killOnce(work, scenario(of), number * kStride); };
 }
-// From that request on; a pass reads before it writes.
-Hunt answers(const std::string& kind, const std::string& of, size_t from = 0) {
-    return [=](Work& work, size_t number) { return spoilRequest(work, scenario(of), from + number, kind); };
+Hunt killsWithNewOnes(const std::string& of, Behind behind) {
+    return [=](Work& work, size_t number) { return killWithNewOnes(work, scenario(of), number * kStride, behind); };
 }
-constexpr size_t kWrites = 42;
-Hunt meetings(const std::string& of) {
-    return [of](Work& work, size_t number) { return meetOnce(work, scenario(of), number); };
+Hunt answers(const std::string& kind, const std::string& of, Spoils spoils = Spoils::all) {
+    return [=](Work& work, size_t number) { return spoilRequest(work, scenario(of), number, kind, spoils); };
 }
-Hunt fullDisks(const std::string& of) {
-    return [of](Work& work, size_t number) { return breakDiskOnce(work, scenario(of), 1, number * 2); };
+Hunt answersToNewOnes(const std::string& kind, const std::string& of) {
+    return [=](Work& work, size_t number) { return spoilNewOnes(work, scenario(of), number, kind); };
+}
+Hunt meetings(const std::string& of, bool newOnes = false) {
+    return [=](Work& work, size_t number) { return meetOnce(work, scenario(of), number, newOnes); };
 }
 bool powerLosses(Work& work, size_t number) {
     losePowerBehindACommand(work, number);
     return true;
 }
-bool damages(Work& work, size_t number) {
-    damageOnce(work, number);
-    return true;
-}
-
 struct SeededBug {
     const char* part; // what is left out, as the sources name it
     Hunt hunt;
@@ -55,26 +51,22 @@ const std::vector<SeededBug>& seededBugs() {
     static const std::vector<SeededBug> all{
         {"if-match", meetings("owner-later")},
         {"sync", powerLosses},
-        {"if-none-match", meetings("owner-later")},
+        {"if-none-match", meetings("owner-later", true)},
         {"412", meetings("owner-later")},
-        {"5xx", answers("500", "writer-later", kWrites)},
-        {"proof", answers("portal page", "writer-later", kWrites)},
-        {"end of listing", answers("half", "owner-later")},
+        {"5xx", answers("500", "writer-later", Spoils::writes)},
+        {"proof", answers("portal page", "writer-later", Spoils::writes)},
+        {"end of listing", answers("half", "owner-later", Spoils::listings)},
         {"lost tree", answers("404", "owner-later")},
         {"queue", answers("503", "owner-later")},
-        {"taking back", answers("403", "writer-later", kWrites)},
-        {"cursor", calmOnce},
         {"states", calmOnce},
-        {"merging", calmOnce},
-        {"deletions win", calmOnce},
+        {"merging", meetings("owner-later")},
         {"unlocking", calmOnce},
-        {"under way", kills("owner-later")},
-        {"note before the workers", kills("writer-later")},
-        {"content before the write", kills("writer-later")},
+        {"under way", killsWithNewOnes("owner-later", Behind::takesBack)},
+        {"note before the workers", killsWithNewOnes("writer-later", Behind::takesBack)},
+        {"content before the write", killsWithNewOnes("writer-later", Behind::changesNumbers)},
+        {"claim", kills("writer-first")},
+        {"unsettled writes", answersToNewOnes("lost answer", "owner-later")},
         {"leftovers", kills("owner-first")},
-        {"rollback", fullDisks("reader-later")},
-        {"rollback of versions", fullDisks("reader-later")},
-        {"absence", damages},
         {"date of the store", turnClockOnce},
     };
     return all;
@@ -86,7 +78,7 @@ public:
 
     // The name of a case that fails without the part, and goes well with it; none was found.
     std::optional<std::string> found() {
-        constexpr size_t kMost = 30;
+        constexpr size_t kMost = 60;
         for (size_t number = 0; number < kMost && !_work.timeIsOver(); ++number) {
             const auto failure = failureOf(number, _bug.part);
             if (!_exists) return std::nullopt;
@@ -121,6 +113,8 @@ void findSeededBugs(Work& work) {
         if (!work.isMine(number)) continue;
         if (work.timeIsOver()) return;
         const SeededBug& bug = seededBugs()[number];
+        if (!work.parts.empty() && std::find(work.parts.begin(), work.parts.end(), bug.part) == work.parts.end())
+            continue;
         const auto found = Search(work, bug).found();
         if (!found && work.timeIsOver()) return; // it may have been cut off
         ++work.count.cases;

@@ -54,8 +54,8 @@ const std::vector<Row>& rows() {
 
 namespace {
 
-constexpr const char* kUsage = R"(usage: board [--seeds LIST] [--rows NAME,...] [--jobs N] [--every N]
-             [--seconds N] [--alone] [--keep DIRECTORY] [--table FILE]
+constexpr const char* kUsage = R"(usage: board [--seeds LIST] [--rows NAME,...] [--parts NAME,...] [--jobs N]
+             [--every N] [--seconds N] [--alone] [--keep DIRECTORY] [--table FILE]
 
 Each row is a kind of fault. A case lets it strike an owner, a writer or a reader at one place, lets everybody make two
 clean passes, and compares the three copies and the store with one another and with what was done. Exit status 1 when
@@ -63,6 +63,7 @@ anything is wrong.
 
   --seeds    numbers, as 1,2,3; each makes other contacts and edits (1)
   --rows     which rows; all unless given
+  --parts    of the row bugs: which parts are left out; all unless given
   --jobs     how many processes work on it (1)
   --every    only each so many-th case (1)
   --seconds  ends after about so long; the rows that were cut off say so
@@ -77,6 +78,7 @@ struct Arguments {
     size_t jobs = 1, every = 1, seconds = 0;
     bool goesOn = true;
     std::string keep, table;
+    std::vector<std::string> parts;
 };
 
 [[noreturn]] void misuse(const std::string& what) {
@@ -121,6 +123,8 @@ Arguments argumentsOf(int argc, char** argv) {
             std::erase_if(
                 a.rows, [&](const Row& row) { return std::find(names.begin(), names.end(), row.name) == names.end(); });
             if (a.rows.size() != names.size()) misuse("there is no such row among " + value);
+        } else if (name == "--parts") {
+            a.parts = listOf(value);
         } else if (name == "--jobs") {
             a.jobs = std::max<size_t>(1, numberOf(value));
         } else if (name == "--every") {
@@ -176,6 +180,7 @@ void work(const Arguments& arguments, Count* counts, size_t job) {
             Count& count = counts[i];
             const auto share = Clock::now() + (end - Clock::now()) / static_cast<int64_t>(left);
             Work todo{*stage, count, job, arguments.jobs, arguments.every, arguments.goesOn, nullptr, nullptr};
+            todo.parts = arguments.parts;
             todo.told = [](const std::string& line) { print(line + "\n"); };
             todo.timeIsOver = [&] {
                 const bool over = arguments.seconds > 0 && count.cases > 0 && Clock::now() > share;

@@ -329,6 +329,19 @@ TEST(ContactMerge, AnEntryThatCameAndWasChangedThereDoesNotStandBesideItself) {
     }
 }
 
+// They have seen 11 and the new entry, removed the one and changed the other.
+TEST(ContactMerge, AnEntryThatCameAndWasChangedThereTellsThatAllOfItsVersionCame) {
+    Facts base, sent, ours, theirs;
+    base.phone = {{"a", {"home", "1"}}};
+    sent.phone = {{"a", {"home", "11"}}, {"b", {"home", "2"}}};
+    ours.phone = sent.phone;
+    theirs.phone = {{"b", {"home", "22"}}};
+    const Dictionary common = cxBaseAfterSending(base.contact(), sent.contact(), theirs.contact());
+    EXPECT_EQ(content(common), content(sent.contact()));
+    const auto result = mergedContact(common, ours.contact(), theirs.contact(), CXSide::ours);
+    EXPECT_EQ(content(result.contact), content(theirs.contact()));
+}
+
 TEST(ContactMerge, OfASingleValueThatMayHaveComeTheOthersStandsAndItIsAConflict) {
     const Dictionary base{{kCXFirstNameProperty, "0"}}, sent{{kCXFirstNameProperty, "1"}},
         theirs{{kCXFirstNameProperty, "2"}};

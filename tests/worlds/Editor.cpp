@@ -180,6 +180,29 @@ void Editor::edit(const Habits& habits) {
     save();
 }
 
+void Editor::makePeople(size_t count) {
+    for (size_t i = 0; i < count; ++i) makePerson();
+    save();
+}
+
+void Editor::changePhoneOfThose(const std::string& stamp) {
+    for (const CXPersonRef& person : people())
+        if (wasMadeWith(person->valueForProperty(kCXFirstNameProperty).string(), stamp)) changePhone(*person);
+    save();
+}
+
+void Editor::takeBack(const std::string& stamp) {
+    for (const CXGroupRef& group : groups())
+        if (wasMadeWith(group->name(), stamp)) remove(group);
+    for (const CXPersonRef& person : people())
+        if (wasMadeWith(person->valueForProperty(kCXFirstNameProperty).string(), stamp)) remove(person);
+    save();
+}
+
+bool Editor::wasMadeWith(const std::string& mark, const std::string& stamp) const {
+    return mark.find(stamp + ".") == 1; // behind the letter of the one who made it
+}
+
 void Editor::setText() {
     const CXPersonRef person = anybody();
     if (!person) return;
@@ -213,6 +236,15 @@ void Editor::changePhones() {
         phones.replaceValueAtIndex(at, Value(rootOf(was) + "/" + after));
     person->setValue(phones, kCXPhoneProperty);
     note(Deed::Kind::set, *person, "Phone/" + rootOf(was), markOf(was), after);
+}
+
+void Editor::changePhone(CXPerson& person) {
+    CXMutableMultiValue phones(person.multiValueForProperty(kCXPhoneProperty).value_or(CXMultiValue()));
+    if (phones.empty()) return;
+    const std::string was = phones.valueAtIndex(0).string(), after = freshMark();
+    phones.replaceValueAtIndex(0, Value(rootOf(was) + "/" + after));
+    person.setValue(phones, kCXPhoneProperty);
+    note(Deed::Kind::set, person, "Phone/" + rootOf(was), markOf(was), after);
 }
 
 void Editor::makePerson() {

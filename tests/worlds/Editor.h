@@ -35,6 +35,10 @@ public:
 
     void makeAtFirst(size_t people, size_t groups);
     void edit(const Habits& habits); // a few edits and one save, or several
+    // One kind of edit of several records, in one save.
+    void makePeople(size_t count);
+    void changePhoneOfThose(const std::string& stamp); // the first phone of those who were made with that stamp
+    void takeBack(const std::string& stamp);           // contacts and groups that were made with that stamp
 
     static View view(CXRolvane& database, const RemoteLocation& location);
 
@@ -47,6 +51,8 @@ private:
     std::vector<CXGroupRef> groups() const;
     CXPersonRef anybody();
     CXGroupRef anyGroup();
+    bool wasMadeWith(const std::string& mark, const std::string& stamp) const;
+    void changePhone(CXPerson& person);
     std::string freshMark();
     UniqueId freshName(std::string_view table);
     void placeHere(CXRecord& record);

@@ -179,12 +179,8 @@ Value sentMultiValue(const Value& base, const Value& sent, const Value& theirs) 
         if (t == kNone && oursOf[b] == kNone) continue; // both have removed it
         add(t != kNone && cameAsSent(t) ? there[t] : before[b]);
     }
-    for (size_t t = 0; t < there.size(); ++t) {
-        if (isOfBase[t] || sentOfTheirs[t] == kNone) continue;
-        // With the identifier that it was given here it has come, whatever it says by now.
-        const auto& entry = cameAsSent(t) ? there[t] : ours[sentOfTheirs[t]];
-        if (!result.indexForIdentifier(entry.identifier)) add(entry);
-    }
+    for (size_t t = 0; t < there.size(); ++t)
+        if (!isOfBase[t] && cameAsSent(t) && !result.indexForIdentifier(there[t].identifier)) add(there[t]);
     return result.toValue();
 }
 
@@ -198,19 +194,19 @@ Value sentList(const Value& base, const Value& sent, const Value& theirs) {
     return result;
 }
 
-// An entry that was new in what was sent lies there: a version is written whole, so all of it has come.
+// An entry that was new in what was sent lies there, by the identifier that it was given here and whatever it says by
+// now: a version is written whole, so all of it has come.
 bool hasCome(const Dictionary& base, const Dictionary& sent, const Dictionary& theirs) {
     return std::any_of(sent.begin(), sent.end(), [&](const auto& property) {
         const auto& [name, value] = property;
         if (!CXMultiValue::isMultiValue(value) || !CXMultiValue::isMultiValue(theirs[name])) return false;
         const Entries before = entriesOf(base[name]), there = entriesOf(theirs[name]);
-        const auto isIn = [](const Entries& entries, const auto& is) {
-            return std::any_of(entries.begin(), entries.end(), is);
-        };
         for (const auto& entry : entriesOf(value)) {
-            const auto hasItsIdentifier = [&](const auto& each) { return each.identifier == entry.identifier; };
-            const auto isTheSame = [&](const auto& each) { return hasItsIdentifier(each) && says(each, entry); };
-            if (!isIn(before, hasItsIdentifier) && isIn(there, isTheSame)) return true;
+            const auto isIn = [&](const Entries& entries) {
+                return std::any_of(entries.begin(), entries.end(),
+                                   [&](const auto& each) { return each.identifier == entry.identifier; });
+            };
+            if (!isIn(before) && isIn(there)) return true;
         }
         return false;
     });

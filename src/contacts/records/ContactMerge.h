@@ -42,10 +42,9 @@ CXMergeResult mergedContact(const std::optional<Dictionary>& base, const Diction
                             CXSide later);
 
 // The base for merging with `theirs` where `sent`, a later version of ours, may have come to the other side or not. An
-// entry or single value of theirs that is as it was sent was had by both; so was an entry missing on purpose, and one
-// that was new in `sent` and has another value there. All else is as in `base`. An entry that was new in `sent` and
-// lies there unchanged says that all of it came: then it is the base itself. Pure; the result shares its containers
-// with the arguments.
+// entry or single value of theirs that is as it was sent was had by both; so was an entry missing on purpose. All else
+// is as in `base`. An entry that was new in `sent` and lies there, changed or not, says that all of it came: then it is
+// the base itself. Pure; the result shares its containers with the arguments.
 Dictionary cxBaseAfterSending(const Dictionary& base, const Dictionary& sent, const Dictionary& theirs);
 // Where `sent` may have come and is older than theirs, a single value of ours that it held gives way to another one of
 // theirs, whatever else was edited here since: the other side may have seen it and replaced it. It stays noted as a
