@@ -11,7 +11,9 @@
 
 #include "acl/CXDAVACLManager.h"
 #include "daemon/DaemonControl.h"
+#include "engine/memory/RightsTakenBack.h"
 #include "model/CXDChangeRecord.h"
+#include "model/Computers.h"
 #include "model/RemoteLocationMap.h"
 #include "store/dav/CXDAVManager.h"
 
@@ -213,12 +215,14 @@ void changeShares(Context& context, const ShareOptions& options, bool grant) {
     const bool hadWriters = !writers.empty();
     grant ? shares.grant(user, options.write) : shares.deny(user);
     // Only a daemon that knew of a writer when it started takes in changes that writers send. It rests before the
-    // lists are saved: ended later, it would be in the middle of carrying them.
-    if (hadWriters == shares.writers().empty()) {
+    // lists are saved: ended later, it would be in the middle of carrying them. So it does where its memory changes.
+    const bool isForgotten = takesBack && !options.noDaemon && isOneOfSeveral(Preferences::shared());
+    if (isForgotten || hadWriters == shares.writers().empty()) {
         const DaemonControl daemon;
         const bool ran = daemon.stop();
         try {
             database.save();
+            if (isForgotten) forgetRightTakenBack(Preferences::shared(), user, !grant);
         } catch (const CXException&) {
             if (ran) daemon.start();
             throw;

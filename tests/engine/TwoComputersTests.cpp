@@ -6,6 +6,7 @@
 #include "conduits/store/ComputersOnStore.h"
 #include "conduits/store/EndedPublication.h"
 #include "engine/memory/EngineState.h"
+#include "engine/memory/RightsTakenBack.h"
 #include "model/Computers.h"
 #include "model/PayloadKeys.h"
 #include "model/RemoteLocationMap.h"
@@ -87,6 +88,18 @@ protected:
         else
             computer.application->allGroup()->setValue(all, property);
         computer.application->save();
+    }
+    // As the command does it: on the store first, and in the database while the daemon rests.
+    static void takeBack(Participant& computer, const std::string& user) {
+        CXDAVManager client(world->account(), world->transport());
+        const Url tree = client.account().baseLocationFor(UserName("alice"));
+        std::vector<std::string> readers, writers;
+        ASSERT_TRUE(client.ACLsAtURL(tree, readers, writers));
+        std::erase(readers, user);
+        ASSERT_TRUE(client.setACLsWithReadPrincipals(readers, writers, tree));
+        computer.start();
+        list(computer, kCXReadSharingACLProperty, {});
+        forgetRightTakenBack(computer.preferences, user, true);
     }
     static std::set<std::string> listed(Participant& computer, const char* property) {
         std::set<std::string> users;
@@ -351,6 +364,19 @@ TEST_F(TwoComputers, RightsThatEitherGrantsOrTakesHoldOnBothAndNoneIsLostInBetwe
     settle();
     EXPECT_EQ(listed(desk, kCXReadWriteSharingACLProperty), std::set<std::string>{"bob"});
     EXPECT_EQ(readersOnStore(), std::set<std::string>{"bob"});
+}
+
+TEST_F(TwoComputers, ARightThatIsTakenBackAndGrantedAgainBetweenTwoPassesHolds) {
+    list(desk, kCXReadSharingACLProperty, {"bob"});
+    joinAndSettle();
+    ASSERT_EQ(readersOnStore(), std::set<std::string>{"bob"});
+    takeBack(laptop, "bob");
+    ASSERT_EQ(readersOnStore(), std::set<std::string>{});
+    list(laptop, kCXReadSharingACLProperty, {"bob"});
+    settle();
+    EXPECT_EQ(readersOnStore(), std::set<std::string>{"bob"}) << log.text();
+    for (Participant* each : {&desk, &laptop})
+        EXPECT_EQ(listed(*each, kCXReadSharingACLProperty), std::set<std::string>{"bob"}) << log.text();
 }
 
 TEST_F(TwoComputers, AListOfWhoJoinsGivesWayToTheStores) {

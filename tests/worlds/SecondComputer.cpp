@@ -3,6 +3,7 @@
 #include "World.h"
 
 #include "contacts/database/DaemonMemory.h"
+#include "engine/memory/RightsTakenBack.h"
 #include "foundation/Preferences.h"
 #include "model/Computers.h"
 #include "store/dav/CXDAVManager.h"
@@ -192,6 +193,9 @@ void World::changeRights(char role) {
         if (*mayRead) readers.push_back(readerOf(role));
         database.allGroup()->setValue(listOf(readers), kCXReadSharingACLProperty);
         database.save();
+        if (*mayRead) return;
+        Preferences preferences(person(role).directory + "/preferences.db", daemonMemory(person(role).database()));
+        forgetRightTakenBack(preferences, readerOf(role), true);
     });
 }
 
