@@ -413,6 +413,20 @@ TEST(VersionMemory, WhatIsOfAnotherStateOfTheDatabaseDoesNotComeBackWithALaterOn
     EXPECT_FALSE(m.knows("u", v));
 }
 
+TEST(VersionMemory, WhatIsOfAnotherStateOfTheDatabaseIsGoneThoughNothingWasAskedNorSaved) {
+    TempDirectory directory;
+    const FileVersion v{EntityTag("\"1\""), {}, 5};
+    {
+        VersionMemory m(directory / "v");
+        m.read("u", v);
+        m.save({7, 3});
+    }
+    VersionMemory(directory / "v").belongTo({7, 2}); // a backup was put back, and the store is away
+    VersionMemory m(directory / "v");
+    m.belongTo({7, 3}); // that pass counts
+    EXPECT_FALSE(m.knows("u", v));
+}
+
 TEST(VersionMemory, AWriteWithoutATagIsKnownBySizeAndServerDate) {
     VersionMemory m;
     m.wrote("u", EntityTag(), Date(1000), "hello");

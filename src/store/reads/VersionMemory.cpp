@@ -154,6 +154,8 @@ void VersionMemory::judge(const Owner& owner) {
         _unsaved.clear();
         _fileNumber = 0;
         _isForeign = true;
+        // At once: this process may end without a save, and the database soon has seen as many passes as the file.
+        if (!_path.empty()) unlink(_path.c_str());
         noteChangeOfMany();
     }
     _owner = owner;
@@ -161,10 +163,8 @@ void VersionMemory::judge(const Owner& owner) {
 
 void VersionMemory::belongTo(const Owner& owner) {
     Lock guard(_mutex);
-    if (_isRead)
-        judge(owner);
-    else
-        _judge = owner;
+    need();
+    judge(owner);
 }
 
 void VersionMemory::revert() {
