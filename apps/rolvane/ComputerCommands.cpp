@@ -1,6 +1,7 @@
 #include "Computers.h"
 #include "Consent.h"
 #include "FailureText.h"
+#include "Invite.h"
 #include "LeftOnStore.h"
 #include "PassReport.h"
 #include "Passes.h"
@@ -130,6 +131,17 @@ bool isTakenIn(Preferences& preferences) {
            users[kSelf.str()].dictionary()[kSerialNumber].isString();
 }
 
+// A list of everybody that names nobody, beside groups that do, is the list of groups published by themselves. Where
+// they have no members either, the file of computers tells: `rolvane publish` makes one with the whole list alone.
+bool holdsSingleGroups(CXDAVManager& store, const Url& base, const OwnTree& tree) {
+    if (!tree.hasList || !tree.people.empty() || tree.groups.empty()) return false;
+    const auto hasMembers = [&](const std::string& group) {
+        const auto state = store.dictionaryAtURL(layout::groupLocation(base, UniqueId(group)), true, nullptr);
+        return state && !(*state)[kMemberUIDState].array().empty();
+    };
+    return tree.computers.empty() || std::any_of(tree.groups.begin(), tree.groups.end(), hasMembers);
+}
+
 OwnTree requireTree(CXDAVManager& store) {
     OwnTree tree = lookAtOwnTree(store);
     if (tree.serial.empty())
@@ -141,6 +153,11 @@ OwnTree requireTree(CXDAVManager& store) {
                            translated("What is published of this account has no list of its contacts, or it cannot be "
                                       "read just now. The computer that published it mends that: run `rolvane sync` "
                                       "there. Nothing was changed."));
+    if (tree.singleGroups)
+        throw CommandError(kRefused,
+                           translated("Single groups are published of this account, and one computer alone keeps those "
+                                      "in step. Publish the whole list on the other computer first, with `rolvane "
+                                      "publish`; or stay without. Nothing was changed."));
     return tree;
 }
 
@@ -396,6 +413,7 @@ OwnTree lookAtOwnTree(CXDAVManager& store) {
         tree.groups = namesIn((*list)[kSubgroupUIDState]);
     }
     if (const auto computers = ComputersOnStore(store, base).read()) tree.computers = *computers;
+    tree.singleGroups = holdsSingleGroups(store, base, tree);
     return tree;
 }
 
@@ -456,11 +474,25 @@ void addComputerCommands(CLI::App& app, Context& context) {
                 ->capture_default_str();
         },
         [&context, joining] { join(context, *joining); });
-    const auto name = std::make_shared<std::string>();
+    struct ListOptions {
+        std::string name;
+        bool invite = false, qr = false;
+    };
+    const auto listing = std::make_shared<ListOptions>();
     addCommand(
         app, context, "computers", "List the computers that keep your contacts in step, and when each was last there",
-        [&](CLI::App& command) { command.add_option("--name", *name, "Call this computer so"); },
-        [&context, name] { name->empty() ? listComputers(context) : rename(context, *name); });
+        [&](CLI::App& command) {
+            const auto name = command.add_option("--name", listing->name, "Call this computer so");
+            const auto invite = command.add_flag("--invite", listing->invite,
+                                                 "Print a line that sets up the account on a further computer of "
+                                                 "yours; the password is in it");
+            invite->excludes(name);
+            command.add_flag("--qr", listing->qr, "Show that line as a QR code, too")->needs(invite);
+        },
+        [&context, listing] {
+            if (listing->invite) return inviteOwnComputer(context, listing->qr);
+            listing->name.empty() ? listComputers(context) : rename(context, listing->name);
+        });
     const auto leaving = std::make_shared<LeaveOptions>();
     addCommand(
         app, context, "leave", "Keep this computer out of step from now on; the contacts stay here and on the store",

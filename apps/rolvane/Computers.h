@@ -28,6 +28,7 @@ nlohmann::ordered_json computersJson(Preferences& preferences, const std::vector
 struct OwnTree {
     std::string serial; // "" where there is none, or it cannot be read
     bool hasList = false;
+    bool singleGroups = false;               // published by themselves: the list of everybody names nobody
     std::vector<std::string> people, groups; // of the list of everybody
     std::vector<Computer> computers;         // that have told of themselves
 };

@@ -90,7 +90,8 @@ const std::map<std::string, const char*>& examples() {
         {"join", "  rolvane join --dry-run\n"
                  "  rolvane join --yes"},
         {"computers", "  rolvane computers\n"
-                      "  rolvane computers --name laptop"},
+                      "  rolvane computers --name laptop\n"
+                      "  rolvane computers --invite --qr"},
         {"leave", "  rolvane leave\n"
                   "  rolvane leave --computer \"old laptop\""},
         {"subscriptions", "  rolvane subscriptions\n"

@@ -36,14 +36,31 @@ std::string authorityFingerprint(const CXDAVAccount& account) {
                                    account.origins().back(), account.caFile));
 }
 
+Invitation invitationTo(const CXDAVAccount& account, const std::string& user) {
+    Invitation invitation;
+    invitation.endpoint = account.secureEndpoint.empty() ? account.endpoint : account.secureEndpoint;
+    invitation.user = user;
+    invitation.fingerprint = authorityFingerprint(account);
+    return invitation;
+}
+
+void printLine(Context& context, const Invitation& invitation, bool qr) {
+    const std::string line = invitation.line();
+    if (context.json)
+        return context.print({{"user", invitation.user},
+                              {"endpoint", invitation.endpoint},
+                              {"fingerprint", invitation.fingerprint},
+                              {"holdsPassword", !invitation.password.empty()},
+                              {"invitation", line}});
+    context.line(line);
+    if (qr) showQrCode(context, line);
+}
+
 void invite(Context& context, const InviteOptions& options) {
     const auto account = CXDAVAccount::load();
     if (!account) throw noAccount();
     requireStore(context, translated("Nobody was invited."));
-    Invitation invitation;
-    invitation.endpoint = account->secureEndpoint.empty() ? account->endpoint : account->secureEndpoint;
-    invitation.user = options.user;
-    invitation.fingerprint = authorityFingerprint(*account);
+    Invitation invitation = invitationTo(*account, options.user);
     invitation.inviter = account->user.str();
     CXDAVAccount theirs;
     theirs.user = UserName(options.user);
@@ -69,14 +86,8 @@ std::string inviterOn(const std::string& endpoint) {
 }
 
 void printInvitation(Context& context, const Invitation& invitation, bool qr) {
-    const std::string line = invitation.line();
-    if (context.json)
-        return context.print({{"user", invitation.user},
-                              {"endpoint", invitation.endpoint},
-                              {"fingerprint", invitation.fingerprint},
-                              {"invitation", line}});
-    context.line(line);
-    if (qr) showQrCode(context, line);
+    printLine(context, invitation, qr);
+    if (context.json) return;
     context.say(tr("`rolvane setup 'LINE'` with this line, typed by {}, sets everything up.", invitation.user));
     if (invitation.password.empty())
         context.say(translated("It holds no password: setup asks for it."));
@@ -86,6 +97,21 @@ void printInvitation(Context& context, const Invitation& invitation, bool qr) {
         context.say(
             translated("Whoever uses it first has the account, and then the line is of no more use: send it so that "
                        "nobody else reads it."));
+}
+
+void inviteOwnComputer(Context& context, bool qr) {
+    const auto account = CXDAVAccount::load();
+    if (!account) throw noAccount();
+    requireStore(context, translated("No line was made."));
+    Invitation invitation = invitationTo(*account, account->user.str());
+    invitation.password = account->password();
+    printLine(context, invitation, qr);
+    if (context.json) return;
+    if (!invitation.password.empty())
+        context.warn(
+            translated("The line holds your password: whoever reads it can sign in as you. Let nobody else see "
+                       "it, and keep it nowhere."));
+    context.say(translated("On the other computer: `rolvane setup 'LINE'` with this line, then `rolvane join`."));
 }
 
 void addInviteCommands(CLI::App& app, Context& context) {

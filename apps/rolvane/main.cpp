@@ -5,6 +5,7 @@
 #include "Context.h"
 #include "HelpCommand.h"
 #include "HelpFormatter.h"
+#include "LineComplaint.h"
 #include "LogCommands.h"
 #include "ManualCommand.h"
 #include "PlanCommand.h"
@@ -69,8 +70,8 @@ int endWith(const CLI::App& app, const CLI::ParseError& error, int argc, char** 
         return kUsage;
     }
     const auto [command, unknown] = namedCommand(app, argc, argv);
-    std::string what =
-        unknown.empty() ? error.what() : tr("There is no command \"{}\"", nameOf(*command) + " " + unknown);
+    std::string what = unknown.empty() ? complaintAboutLine(error.what())
+                                       : tr("There is no command \"{}\"", nameOf(*command) + " " + unknown);
     if (what.ends_with('.')) what.pop_back();
     std::cerr << shownText("rolvane: " + what + "." + didYouMean(suggestions(unknown, namesBelow(*command))) +
                            tr(" `{} --help` shows what can be given.", nameOf(*command)) + "\n");

@@ -73,6 +73,22 @@ TEST_F(Computers, JoinRefusesATreeWithoutItsList) {
     EXPECT_EQ(onLaptop(), "");
 }
 
+TEST_F(Computers, JoinRefusesATreeOfSingleGroups) {
+    world.done({"publish", "--group", "Friends"});
+    const auto before = treeWithContents();
+    EXPECT_TRUE(saysOnce(laptop->rolvane({"join", "--yes"}), kNotAllowed, "rolvane publish"))
+        << "the other one publishes";
+    EXPECT_EQ(treeWithContents(), before);
+    EXPECT_EQ(laptop->json({"status"})["published"]["everything"], false);
+    world.group("Nobody");
+    world.done({"unpublish", "--yes"});
+    world.done({"publish", "--group", "Nobody"});
+    EXPECT_EQ(laptop->rolvane({"join", "--yes"}).status, kNotAllowed) << "a group without members";
+    world.done({"publish"});
+    laptop->done({"join", "--yes"});
+    EXPECT_EQ(onLaptop(), onDesk());
+}
+
 TEST_F(Computers, JoinAsksAndTriesWithoutChangingAnything) {
     world.done({"publish"});
     laptop->done({"add", "--first", "Dora"});
@@ -225,6 +241,38 @@ TEST_F(Computers, ANewComputerHasEverythingAgainByJoining) {
 }
 
 // The commands of docs/computers.md, but for the account, which both have.
+TEST_F(Computers, AnotherOneIsInvitedByALineThatHoldsThePassword) {
+    world.done({"publish"});
+    const Ran ran = world.rolvane({"computers", "--invite"});
+    ASSERT_EQ(ran.status, kDone) << ran;
+    EXPECT_EQ(lineCount(ran.output), 1U) << ran;
+    EXPECT_TRUE(ran.output.starts_with("rolvane:1:")) << ran;
+    EXPECT_NE(ran.errors.find("The line holds your password"), std::string::npos) << ran;
+    EXPECT_NE(ran.errors.find("rolvane join"), std::string::npos) << ran;
+    EXPECT_GT(lineCount(world.done({"computers", "--invite", "--qr"})), 10U);
+    const auto told = world.json({"computers", "--invite"});
+    EXPECT_EQ(told["holdsPassword"], true);
+    EXPECT_EQ(told["invitation"].get<std::string>() + "\n", ran.output);
+    Neighbour third(world, UserWorld::kUser, Neighbour::NothingYet{});
+    third.done({"setup", told["invitation"], "--no-input"});
+    third.done({"join", "--yes"});
+    EXPECT_EQ(people(third.json({"list"})), onDesk());
+    EXPECT_EQ(third.json({"subscriptions"}), nlohmann::json::array()) << "nobody subscribes to oneself";
+    world.done({"sync"});
+    EXPECT_EQ(world.rolvane({"computers", "--qr"}).status, kWrongLine);
+    EXPECT_EQ(world.rolvane({"computers", "--invite", "--name", "x"}).status, kWrongLine);
+}
+
+TEST_F(Computers, AnotherOneIsInvitedByNobodyWithoutAnAccountOrAStore) {
+    Neighbour fresh(world, "fresh", Neighbour::NothingYet{});
+    EXPECT_EQ(fresh.rolvane({"computers", "--invite"}).status, kNoSuchThing);
+    world.done({"publish"});
+    world.store().stop(PrivateStore::Stop::atOnce);
+    const Ran ran = world.rolvane({"computers", "--invite"});
+    EXPECT_EQ(ran.status, kNotReached) << ran;
+    EXPECT_EQ(ran.output, "") << "the password goes nowhere";
+}
+
 TEST_F(Computers, AreLedByAPageThatDoesWhatItSays) {
     const std::string page = contentsOf(ROLVANE_SOURCE_DIR "/docs/computers.md");
     const std::regex prompt("\n    (first|second)\\$ rolvane ([^\n]*)");

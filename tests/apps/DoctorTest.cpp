@@ -9,6 +9,7 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <regex>
 #include <unistd.h>
 
 namespace rolvane::test {
@@ -187,6 +188,29 @@ TEST_F(TheDoctor, NamesAnAuthorityThatEndsSoon) {
     const auto finding = of(examine(), "authority");
     EXPECT_EQ(finding["state"], "note") << finding;
     EXPECT_EQ(finding["what"].get<std::string>().find("The store's authority is good until "), 0U) << finding;
+}
+
+// A real server whose certificates have ended two days ago.
+TEST(TheDoctorOfAnEndedStore, NamesWhatHasEndedAndWhen) {
+    CommandWorld world;
+    PrivateStoreOptions options;
+    options.stateDirectory = world.home / "ended";
+    options.ownsProcess = true;
+    options.certificateLifetime = -std::chrono::hours(48);
+    PrivateStore store(options);
+    store.addUser(UserWorld::kUser, UserWorld::kPassword);
+    store.start();
+    world.done({"account", "set", "--endpoint", store.endpointTemplate(), "--user", UserWorld::kUser, "--ca-file",
+                store.caFile(), "--ask-password"},
+               std::string(UserWorld::kPassword) + "\n");
+    const auto told = world.json({"doctor"}, kFailure);
+    nlohmann::json authority;
+    for (const auto& finding : told["findings"])
+        if (finding["check"] == "authority") authority = finding;
+    EXPECT_EQ(authority["state"], "failed") << told.dump(2);
+    EXPECT_TRUE(std::regex_search(authority["what"].get<std::string>(), std::regex("^The store's .* ended on ")))
+        << authority;
+    EXPECT_EQ(authority["toDo"], "rolvane store stop && rolvane store start");
 }
 
 // A store whose administrator has forbidden or switched off a method.

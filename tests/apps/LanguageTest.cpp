@@ -47,6 +47,28 @@ TEST_F(Language, OfTextsIsGermanOrFrenchWhereThePersonSpeaksIt) {
     EXPECT_TRUE(saysOnce(world.rolvane({"show", "Nobody"}), kNoSuchThing, "Il n'y a pas de personne « Nobody »."));
 }
 
+TEST_F(Language, OfWhatIsWrongWithALineIsGermanOrFrench) {
+    const std::vector<std::string> number{"sync", "--timeout", "x"}, choice{"store", "start", "--authentication", "x"},
+        both{"store", "start", "--system", "--directory", "/nowhere"};
+    speak("C");
+    EXPECT_TRUE(saysOnce(world.rolvane({"show"}), kWrongLine, "rolvane: names is missing. `rolvane show --help`"));
+    EXPECT_TRUE(saysOnce(world.rolvane({"list", "--foo"}), kWrongLine, "rolvane: Nothing is known of: --foo."));
+    EXPECT_TRUE(saysOnce(world.rolvane({"store"}), kWrongLine, "A command is missing behind this one."));
+    EXPECT_TRUE(saysOnce(world.rolvane({"publish", "--group"}), kWrongLine, "--group lacks its value."));
+    EXPECT_TRUE(saysOnce(world.rolvane(number), kWrongLine, "--timeout takes a number greater than 0, not \"x\"."));
+    EXPECT_TRUE(
+        saysOnce(world.rolvane(choice), kWrongLine, "--authentication takes one of basic,digest,none, not \"x\"."));
+    EXPECT_TRUE(saysOnce(world.rolvane(both), kWrongLine, "--directory and --system exclude each other."));
+    EXPECT_TRUE(saysOnce(world.rolvane({"computers", "--qr"}), kWrongLine, "--qr is of use with --invite alone."));
+    speak("de_DE.UTF-8");
+    EXPECT_TRUE(saysOnce(world.rolvane({"show"}), kWrongLine, "rolvane: names fehlt."));
+    EXPECT_TRUE(saysOnce(world.rolvane({"list", "--foo"}), kWrongLine, "Unbekannt ist: --foo."));
+    EXPECT_TRUE(saysOnce(world.rolvane(number), kWrongLine, "--timeout nimmt eine Zahl größer als 0, nicht „x“."));
+    speak("fr_FR.UTF-8");
+    EXPECT_TRUE(saysOnce(world.rolvane(both), kWrongLine, "--directory et --system s'excluent."));
+    EXPECT_TRUE(saysOnce(world.rolvane({"publish", "--group"}), kWrongLine, "--group n'a pas de valeur."));
+}
+
 TEST_F(Language, OfTextsIsSpokenOnASystemThatHasNotMadeItsOwnFilesForIt) {
     world.home.setVariable("LOCPATH", world.home / "none");
     world.home.setVariable("LANG", "de_DE.UTF-8");
