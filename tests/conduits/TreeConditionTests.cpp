@@ -242,6 +242,19 @@ TEST(TreeCondition, AContactThatIsKnownByGroupsAloneHasLeftOne) {
     EXPECT_TRUE(unlistedContactsThatLeftAGroup({}, now).empty());
 }
 
+TEST(TreeCondition, ContactsThatHaveLeftThisPersonsDatabaseAreDeletedAndNotLost) {
+    const auto nobodyIsHere = [](const UniqueId&) { return false; };
+    const auto oneIsHere = [](const UniqueId& uid) { return uid.str() == "a:CXPerson"; };
+    const Dictionary empty = without(tree(), kPeopleState);
+    EXPECT_EQ(treeCondition(tree(), empty, std::nullopt, oneIsHere).kind, Kind::lostContacts);
+    EXPECT_TRUE(treeCondition(tree(), empty, std::nullopt, nobodyIsHere).isSound());
+    Dictionary another = tree();
+    another.set("AllCXGroup",
+                Dictionary{{kMemberUIDState, Array{"c:CXPerson"}}, {kSubgroupUIDState, Array{"G:CXGroup"}}});
+    EXPECT_EQ(treeCondition(tree(), another, std::nullopt).kind, Kind::replacedList);
+    EXPECT_TRUE(treeCondition(tree(), another, std::nullopt, oneIsHere).isSound());
+}
+
 TEST(TreeCondition, AGroupThatHasLeftItsOwnersDatabaseAndTheTreeIsDeletedThoughEverybodysListNamesIt) {
     const Dictionary now = without(tree(), "G:CXGroup");
     const auto isHere = [](const UniqueId& uid) { return uid.str() != "G:CXGroup"; };

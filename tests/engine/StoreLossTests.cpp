@@ -362,4 +362,60 @@ TEST_F(StoreLoss, AGroupThatAWriterDeletesIsNotTakenForALoss) {
     EXPECT_EQ(copies(), alice.view());
 }
 
+TEST_F(StoreLoss, AWritersChangesWaitUntilTheOwnerHasMendedTheTree) {
+    settle();
+    const auto work = alice.group("Work", {people[0]});
+    alice.application->save();
+    settle();
+    std::filesystem::remove_all(tree() / work->uniqueId().str());
+    bob.pass();
+    const auto groupHere = [&](const CXGroupRef& group) {
+        return std::dynamic_pointer_cast<CXGroup>(
+            bob.application->recordForUniqueId(cxUIDWithTableName(group->uniqueId(), kCXSubscribedGroupTable)));
+    };
+    groupHere(friends)->setValue(Value("Comrades"), kCXGroupNameProperty);
+    groupHere(work)->setValue(Value("Office"), kCXGroupNameProperty);
+    bob.application->removeRecord(bob.copyOf(people[1]));
+    bob.application->save();
+    bob.wire->clear();
+    bob.pass();
+    for (const char* write : {"PUT /dav/alice", "DELETE /dav/alice"})
+        EXPECT_EQ(bob.wire->text().find(write), std::string::npos) << bob.wire->text();
+    EXPECT_FALSE(bob.engine->getPendingChanges().empty());
+    for (int i = 0; i < 3; ++i) settle();
+    EXPECT_EQ(alice.countPeople(), 2u) << log.text();
+    EXPECT_EQ(friends->valueForProperty(kCXGroupNameProperty), Value("Comrades")) << log.text();
+    EXPECT_EQ(work->valueForProperty(kCXGroupNameProperty), Value("Office")) << log.text();
+    EXPECT_EQ(copies(), alice.view()) << log.text();
+    EXPECT_TRUE(bob.engine->getPendingChanges().empty());
+}
+
+// A pass of the writer's has ended between the group's file and its name.
+TEST_F(StoreLoss, AWriterGoesOnDeletingAGroupWhoseFileIsGone) {
+    settle();
+    std::filesystem::remove_all(tree() / friends->uniqueId().str());
+    bob.application->removeRecord(
+        bob.application->recordForUniqueId(cxUIDWithTableName(friends->uniqueId(), kCXSubscribedGroupTable)));
+    bob.application->save();
+    bob.pass();
+    EXPECT_TRUE(bob.engine->getPendingChanges().empty()) << log.text();
+    settle();
+    EXPECT_TRUE(alice.application->listGroups(RemoteLocation()).empty()) << log.text();
+    EXPECT_EQ(copies(), alice.view());
+}
+
+TEST_F(StoreLoss, AWriterGoesOnDeletingAllContactsWhoseFilesAreGone) {
+    settle();
+    for (const CXPersonRef& person : people) {
+        std::filesystem::remove(fileOf(person));
+        bob.application->removeRecord(bob.copyOf(person));
+    }
+    bob.application->save();
+    bob.pass();
+    EXPECT_TRUE(bob.engine->getPendingChanges().empty()) << log.text();
+    settle();
+    EXPECT_EQ(alice.countPeople(), 0u) << log.text();
+    EXPECT_EQ(copies(), alice.view());
+}
+
 } // namespace rolvane::test

@@ -128,7 +128,6 @@ void CXDVaultraConduit::open() {
     _with.manager.expectNothing();
     _with.manager.useVersionMemoryOf(database().databaseIdentity(), database().shareCount());
     _writes.giveUpMerged(); // of a pass that failed
-    _setBack.clear();
     _writtenInOrder.clear();
     _compared.clear(); // of a pass that failed
     _lookedAt.clear();

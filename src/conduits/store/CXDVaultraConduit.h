@@ -142,8 +142,9 @@ private:
     std::optional<Dictionary> contactsChangedSince(const UserName& user, const Url& base, const Comparison& before);
     void noteWithoutChanges(int64_t journal, const std::set<UserName>& changed);
     void beginReading();
-    void lookAfterStructure(bool meanwhile); // while the pass goes on
-    void awaitStructure();                   // any thread
+    void lookAfterStructure(bool meanwhile);          // while the pass goes on
+    void awaitStructure();                            // any thread
+    bool isHeld(const CXDChangeRecord& record) const; // any thread
     void publishAgain(const TreeCondition& condition, const Dictionary& state);
     void readPublishAgain();
     void restoreAccessLists();
@@ -214,7 +215,7 @@ private:
     bool _isOneOfSeveral = false;                 // as of the last look; constant while a pass writes, as are these two
     bool _takesIn = false;                        // this pass does nothing else with the own tree
     std::optional<Date> _takenIn;                 // the tree, as it was at that date
-    std::set<UserName> _setBack;                  // other trees that are, as this pass has seen; main thread
+    std::set<UserName> _leftAlone;                // other trees, until their owners have mended them; as _takesIn
     CXDChangeRecords _leftovers;                  // of the gathering that is under way
     std::set<UniqueId> _foundAgain;               // contacts that the next look takes away, too; of this gathering
     std::map<UserName, Dictionary> _read;         // so far: the states of known users

@@ -54,12 +54,17 @@ bool CXDVaultraConduit::lockStructureForRecord(const CXDChangeRecord& record) {
 
 bool CXDVaultraConduit::applyChangeRecord(const CXDChangeRecordPtr& record, bool* denied) {
     if (denied) *denied = false;
-    if (_vaultraOffLine || (_ownTreeIsHeld && record->changeMadeByDataOwner()) || !lockStructureForRecord(*record))
-        return false;
+    if (_vaultraOffLine || isHeld(*record) || !lockStructureForRecord(*record)) return false;
     int code = 0;
     const bool applied = mayBeNamed(record) ? apply(*record, code) : true;
     if (denied) *denied = code == kForbidden;
     return applied;
+}
+
+// An owner who mends a tree writes the own versions over everything that lies there. So a writer's change waits for it.
+bool CXDVaultraConduit::isHeld(const CXDChangeRecord& record) const {
+    if (record.changeMadeByDataOwner()) return _ownTreeIsHeld;
+    return record.user() && _leftAlone.contains(*record.user());
 }
 
 void CXDVaultraConduit::wasRefused(const CXDChangeRecord& record) {
@@ -176,8 +181,7 @@ UniqueId CXDVaultraConduit::inDatabase(const CXDChangeRecord& record) {
 
 // Where nobody else writes there is nothing to merge with. What an older copy of a tree holds is no news.
 bool CXDVaultraConduit::mergesInto(const UserName& user) {
-    if (user == kSelf) return _isWrittenByOthers && !_isOlderCopy;
-    return !_setBack.contains(user);
+    return user != kSelf || (_isWrittenByOthers && !_isOlderCopy);
 }
 
 CXDChangeRecords CXDVaultraConduit::takeMerged() {

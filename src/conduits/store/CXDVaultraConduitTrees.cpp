@@ -51,6 +51,7 @@ private:
 
 bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state) {
     const bool isOwn = user == kSelf;
+    _leftAlone.erase(user);
     const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
     const Dictionary* known = users[user.str()].dictionaryIf();
     if (!known) return true;
@@ -60,9 +61,10 @@ bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state)
     const bool isAnother = serial.isString() && knownSerial.isString() && knownSerial != serial;
     if (isOwn && !(_isOneOfSeveral && isAnother) && !isMended(prior, state)) return false;
     if (!serial.isString() || isAnother) return true; // no tree, or another one
-    const IsHere isHere = [&](const UniqueId& name) { return _with.rolvane.recordForUniqueId(name) != nullptr; };
-    const TreeCondition condition =
-        isOwn ? treeCondition(prior, state, _lastSyncDate, isHere) : treeCondition(prior, state, std::nullopt);
+    const IsHere isHere = [&](const UniqueId& name) {
+        return _with.rolvane.recordForUniqueId(nameInDatabase(user, name)) != nullptr;
+    };
+    const TreeCondition condition = treeCondition(prior, state, isOwn ? _lastSyncDate : std::nullopt, isHere);
     const Value looked = prior[kLookAgain];
     prior.remove(kLookAgain);
     if (condition.isSound()) {
@@ -76,7 +78,7 @@ bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state)
           isOwn ? "It is published again." : "It is left alone until its owner has mended it.");
     if (condition.kind == TreeCondition::Kind::setBack) prior.set(kTreeDates, datesToWaitFor(state));
     if (!isOwn) {
-        if (condition.kind == TreeCondition::Kind::setBack) _setBack.insert(user);
+        _leftAlone.insert(user);
         return false;
     }
     const bool isRefused = !engine().conduitObjectForKey(kConduitCX, kRefusedByStore).empty();
@@ -113,7 +115,8 @@ std::optional<Dictionary> CXDVaultraConduit::contactsChangedAlone(const UserName
     const auto before = _foundNothing.find(user);
     const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
     const Dictionary* known = users[user.str()].dictionaryIf();
-    if (before == _foundNothing.end() || !known || known->contains(kAllIsNew)) return std::nullopt;
+    if (before == _foundNothing.end() || !known || known->contains(kAllIsNew) || _leftAlone.contains(user))
+        return std::nullopt;
     if (user == kSelf && (_takesIn || (_isOneOfSeveral && isToTellAgain((*known)[kSerialNumber])))) return std::nullopt;
     const auto now = comparisonWith(user, base, true);
     if (!now || now->states != before->second.states ||

@@ -26,6 +26,10 @@ bool isGroup(std::string_view name) {
     return name.ends_with("CXGroup");
 }
 
+bool isOrMayBeHere(const IsHere& isHere, const Value& name) {
+    return !isHere || isHere(UniqueId(name.string()));
+}
+
 bool isNamed(const Value& remembered, const std::string& name) {
     return remembered.isArray() ? remembered.array().containsString(name) : remembered.dictionary().contains(name);
 }
@@ -51,7 +55,7 @@ bool hasLostAGroup(const Dictionary& prior, const Dictionary& current, const IsH
     std::vector<std::string> missing;
     for (const auto& [name, group] : prior)
         if (isGroup(name) && name != kEverybody && !group.dictionary().empty() && current[name].dictionary().empty())
-            if (!isHere || isHere(UniqueId(name))) missing.push_back(name);
+            if (isOrMayBeHere(isHere, Value(name))) missing.push_back(name);
     if (missing.empty()) return false;
     const auto listed = groupsThatAreListed(prior, current);
     return std::any_of(missing.begin(), missing.end(), [&](const auto& name) { return listed.contains(name); });
@@ -67,12 +71,12 @@ bool isSetBack(const Dictionary& prior, const Dictionary& current, const std::op
 
 // A change of the list that met no list, and was written as if it were all of it. Who is deleted leaves the list and
 // the tree; here nobody whom the list named before is in it, and every one of them lies there.
-bool isListReplaced(const Array& before, const Array& now, const Dictionary& people) {
+bool isListReplaced(const Array& before, const Array& now, const Dictionary& people, const IsHere& isHere) {
     if (now.empty() || before.count() < 2 || people.count() < before.count()) return false;
     std::unordered_set<std::string> named;
     for (const Value& name : now) named.insert(name.string());
     return std::all_of(before.begin(), before.end(), [&](const Value& name) {
-        return !named.contains(name.string()) && people.contains(name.string());
+        return !named.contains(name.string()) && people.contains(name.string()) && isOrMayBeHere(isHere, name);
     });
 }
 
@@ -111,12 +115,13 @@ TreeCondition treeCondition(const Dictionary& prior, const Dictionary& current, 
     const Array* listed = everybody.dictionary()[kMemberUIDState].arrayIf();
     if (!listed && (everybody || !hasContacts || lastVisit))
         return {Kind::lostLists, "has lost the list of its contacts"};
-    if (listed && isListReplaced(prior[kEverybody].dictionary()[kMemberUIDState].array(), *listed, people))
+    if (listed && isListReplaced(prior[kEverybody].dictionary()[kMemberUIDState].array(), *listed, people, isHere))
         return {Kind::replacedList, "has another list, which names nobody of those who lie there"};
     if (hasLostAGroup(prior, current, isHere)) return {Kind::lostAGroup, "has lost a group that it still names"};
-    const bool isEmptied = listed && listed->empty();
     // A writer takes a contact's file away before the name. Its owner writes what is missing, file by file.
-    if (!hasContacts && !isEmptied && !lastVisit) return {Kind::lostContacts, "has lost the contents of its contacts"};
+    const bool misses = !listed || std::any_of(listed->begin(), listed->end(),
+                                               [&](const Value& name) { return isOrMayBeHere(isHere, name); });
+    if (!hasContacts && misses && !lastVisit) return {Kind::lostContacts, "has lost the contents of its contacts"};
     return {};
 }
 

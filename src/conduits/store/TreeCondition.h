@@ -30,7 +30,7 @@ inline constexpr const char* kUnlistedContacts = "UnlistedContacts"; // name -> 
 // may be cut off in between for as long as a machine is switched off. One without the other is left so long.
 inline constexpr double kPatience = 7 * 86400; // seconds
 
-// Whether the owner's database, or the copy, has a person or group.
+// Whether the owner's database, or a subscriber's copy, has a person or group of the tree.
 using IsHere = std::function<bool(const UniqueId& name)>;
 
 struct TreeCondition {
@@ -53,7 +53,7 @@ struct TreeCondition {
 // `prior` is the state that the last pass left, `current` what the store says now, both of one tree (one serial
 // number). `lastVisit`: of the owner, the date that "dateFile" had when the owner's last pass ended.
 // The owner knows of a list that is nowhere; to a subscriber the contacts that lie there are one.
-// `isHere`, of the owner: a group that has left the database, too, is deleted and not lost.
+// `isHere`: groups and contacts that have left this person's database, too, are deleted and not lost.
 TreeCondition treeCondition(const Dictionary& prior, const Dictionary& current, std::optional<Date> lastVisit,
                             const IsHere& isHere = {});
 
