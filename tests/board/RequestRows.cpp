@@ -17,6 +17,7 @@ constexpr std::array kKinds{
 // The last kind takes the twenty seconds until a client gives up, and comes at each so many-th request.
 constexpr size_t kHangs = 12;
 constexpr size_t kMostRequests = 2000;
+constexpr int64_t kAnHour = 3600; // a refused change rests for half an hour at most
 
 std::string whole(int status, const std::string& type, const std::string& body, size_t announced) {
     return "HTTP/1.1 " + std::to_string(status) + " Said\r\nContent-Type: " + type +
@@ -112,11 +113,31 @@ bool spoilRequest(Work& work, const Scenario& scenario, size_t request, const st
     if (kind == "403" && scenario.role == 'w' && changes(met)) stage.model().refused('w');
     goOn(work, scenario, request);
     Settling settling = settlingOf(scenario);
-    constexpr int64_t kAnHour = 3600; // what a store has refused rests for half an hour at most
     settling.later = kAnHour;
     judge(work,
           scenario.name + ", " + kind + " at request " + std::to_string(request) + " " + met.substr(0, met.find(' ')),
           settling, ending);
+    return true;
+}
+
+bool spoilWrites(Work& work, const Scenario& scenario, size_t write, const std::string& kind) {
+    Stage& stage = work.stage;
+    stage.forgetStory();
+    stage.bringBack(scenario.name);
+    Ending ending;
+    std::string met;
+    {
+        const Spoiled spoiled(stage.entrance(), write, kind, Spoils::writes, kMostRequests);
+        ending = stage.pass(scenario.role);
+        met = spoiled.met();
+    }
+    if (met.empty()) return false;
+    stage.tell("   FAULT " + kind + " from " + met + " on");
+    if (kind == "403" && scenario.role == 'w') stage.model().refused('w');
+    goOn(work, scenario, write);
+    Settling settling = settlingOf(scenario);
+    settling.later = kAnHour;
+    judge(work, scenario.name + ", " + kind + " from write " + std::to_string(write) + " on", settling, ending);
     return true;
 }
 

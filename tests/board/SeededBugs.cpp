@@ -2,6 +2,7 @@
 
 #include "ClockRows.h"
 #include "KillRows.h"
+#include "LossRows.h"
 #include "MeetingRows.h"
 #include "PowerRows.h"
 #include "RequestRows.h"
@@ -32,6 +33,9 @@ Hunt killsWithNewOnes(const std::string& of, Behind behind) {
 Hunt answers(const std::string& kind, const std::string& of, Spoils spoils = Spoils::all) {
     return [=](Work& work, size_t number) { return spoilRequest(work, scenario(of), number, kind, spoils); };
 }
+Hunt answersToWrites(const std::string& kind, const std::string& of) {
+    return [=](Work& work, size_t number) { return spoilWrites(work, scenario(of), number, kind); };
+}
 Hunt answersToNewOnes(const std::string& kind, const std::string& of) {
     return [=](Work& work, size_t number) { return spoilNewOnes(work, scenario(of), number, kind); };
 }
@@ -56,8 +60,9 @@ const std::vector<SeededBug>& seededBugs() {
         {"5xx", answers("500", "writer-later", Spoils::writes)},
         {"proof", answers("portal page", "writer-later", Spoils::writes)},
         {"end of listing", answers("half", "owner-later", Spoils::listings)},
-        {"lost tree", answers("404", "owner-later")},
-        {"queue", answers("503", "owner-later")},
+        {"lost tree", loseFilesOnce},
+        {"queue", answersToWrites("503", "owner-later")},
+        {"taking back", answersToWrites("403", "writer-later")},
         {"states", calmOnce},
         {"merging", meetings("owner-later")},
         {"unlocking", calmOnce},

@@ -5,6 +5,7 @@
 #include "foundation/CXException.h"
 #include "support/UserWorld.h"
 
+#include <algorithm>
 #include <csignal>
 #include <cstdlib>
 #include <cstring>
@@ -208,6 +209,20 @@ void Stage::bringBack(const std::string& name) {
 
 void Stage::bringBackHome(const std::string& name, char role) {
     shell("rm -rf " + home(role) + " && cp -a " + kept(name, role) + " " + home(role));
+}
+
+void Stage::loseFromTree(const std::function<bool(const std::string& file, size_t number)>& isLost) {
+    std::vector<fs::path> files;
+    for (const auto& entry : fs::recursive_directory_iterator(_store.userDirectory(userOf('o')) + "/Contacts"))
+        if (entry.is_regular_file()) files.push_back(entry.path());
+    std::sort(files.begin(), files.end(),
+              [](const fs::path& a, const fs::path& b) { return a.filename() < b.filename(); });
+    std::map<std::string, size_t> numbers; // by ending
+    for (const fs::path& file : files) {
+        const std::string name = file.filename();
+        const size_t colon = name.find(':');
+        if (isLost(name, numbers[colon == std::string::npos ? name : name.substr(colon)]++)) fs::remove(file);
+    }
 }
 
 std::string Stage::scratch(const std::string& name) const {

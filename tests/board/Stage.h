@@ -68,6 +68,9 @@ public:
     std::string kept(const std::string& name, char role) const {
         return _directory / ("kept/" + name + "/" + std::string(1, role));
     }
+    // The store loses files of the owner's tree. They are asked for in the order of their names; the number says how
+    // many with the same ending came before.
+    void loseFromTree(const std::function<bool(const std::string& file, size_t number)>& isLost);
     // An empty place for a file, of that name.
     std::string scratch(const std::string& name) const;
 

@@ -5,6 +5,7 @@
 #include "DamageRows.h"
 #include "DiskRows.h"
 #include "KillRows.h"
+#include "LossRows.h"
 #include "MeetingRows.h"
 #include "PowerRows.h"
 #include "RequestRows.h"
@@ -17,6 +18,7 @@
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
+#include <filesystem>
 #include <fstream>
 #include <iostream>
 #include <memory>
@@ -43,6 +45,7 @@ const std::vector<Row>& rows() {
         {"meet",
          "a contact is written by somebody else, who asks for no lock, between a pass's reading and its writing", meet,
          true},
+        {"loss", "the store loses a file, or all files of a kind, of a tree that everybody has in step", loseFiles},
         {"damage", "the database, its log, the account or another file of a home damaged at a place of chance", damage},
         {"stay", "daemons that stay make 1,000 passes with 10,000 changes, and a tenth of the requests fails",
          stayAndWork, true},
@@ -149,6 +152,7 @@ void print(const std::string& text) {
 void keepStory(const Arguments& arguments, const Stage& stage, const std::string& row, std::string name) {
     if (arguments.keep.empty()) return;
     std::replace(name.begin(), name.end(), ' ', '-');
+    std::filesystem::create_directories(arguments.keep);
     std::ofstream(arguments.keep + "/" + row + "-seed-" + std::to_string(stage.seed()) + "-" + name) << stage.story();
 }
 
