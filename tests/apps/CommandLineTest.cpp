@@ -86,7 +86,7 @@ TEST_F(CommandLine, AnUnknownOptionIsNamedTogetherWithTheCommandsHelp) {
 }
 
 TEST_F(CommandLine, WhatIsMissingIsNamed) {
-    EXPECT_TRUE(saysOnce(world.rolvane({"group"}), kWrongLine, "subcommand"));
+    EXPECT_TRUE(saysOnce(world.rolvane({"group"}), kWrongLine, "A command is missing behind this one"));
     EXPECT_TRUE(saysOnce(world.rolvane({"show"}), kWrongLine, "names"));
     EXPECT_TRUE(saysOnce(world.rolvane({"group", "rename", "Family"}), kWrongLine, "name"));
 }
