@@ -90,7 +90,7 @@ void CXDVaultraConduit::beginReading() {
         const UserName user = engine().userForRemoteLocation(location);
         const auto base = user.empty() || user == kSelf ? std::nullopt : baseLocationForUser(user);
         if (!base) continue;
-        if (!_foundNothing.contains(user)) // else it is read when the tree has changed
+        if (!_moments.contains(user)) // else it is read when the tree has changed
             _with.manager.expectSomeReads({base->cxURLByAppendingComponent(layout::kInfo)}, false);
         _with.manager.expectListing(*base);
         return; // a wrong password is not to be offered many times

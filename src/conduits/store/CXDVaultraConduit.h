@@ -136,11 +136,16 @@ private:
         int64_t journal = 0;
         uint64_t states = 0;
         CXDAVManager::TreeMark tree;
-        bool operator==(const Comparison&) const = default;
+        std::set<UniqueId> found; // contacts that were to be read then, as the tree names them
+    };
+    // What the gathering under way has found in a tree.
+    struct Found {
+        bool isContactsAlone = true;
+        std::set<UniqueId> contacts;
     };
     std::optional<Comparison> comparisonWith(const UserName& user, const Url& base, bool ask);
     std::optional<Dictionary> contactsChangedSince(const UserName& user, const Url& base, const Comparison& before);
-    void noteWithoutChanges(int64_t journal, const std::set<UserName>& changed);
+    void noteCompared(int64_t journal, const std::map<UserName, Found>& found);
     void beginReading();
     void lookAfterStructure(bool meanwhile);          // while the pass goes on
     void awaitStructure();                            // any thread
@@ -211,18 +216,18 @@ private:
     std::atomic<bool> _isWrittenByOthers = false; // the own tree, as of the last open
     std::atomic<bool> _isOlderCopy = false;       // the own tree: it is older than the database
     Dictionary _lostList; // of the own tree that is published again, as its files tell it; else empty
-    std::atomic<bool> _ownTreeIsHeld = false;     // nothing of ours is written there yet
-    bool _isOneOfSeveral = false;                 // as of the last look; constant while a pass writes, as are these two
-    bool _takesIn = false;                        // this pass does nothing else with the own tree
-    std::optional<Date> _takenIn;                 // the tree, as it was at that date
-    std::set<UserName> _leftAlone;                // other trees, until their owners have mended them; as _takesIn
-    CXDChangeRecords _leftovers;                  // of the gathering that is under way
-    std::set<UniqueId> _foundAgain;               // contacts that the next look takes away, too; of this gathering
-    std::map<UserName, Dictionary> _read;         // so far: the states of known users
-    std::map<UserName, Comparison> _foundNothing; // the last comparisons that found nothing
-    std::map<UserName, Comparison> _compared;     // those that the gathering under way has not made again
-    std::map<UserName, Comparison> _lookedAt;     // and what it has seen of these trees
-    bool _gathering = false;                      // `open` belongs to a gathering
+    std::atomic<bool> _ownTreeIsHeld = false; // nothing of ours is written there yet
+    bool _isOneOfSeveral = false;             // as of the last look; constant while a pass writes, as are these two
+    bool _takesIn = false;                    // this pass does nothing else with the own tree
+    std::optional<Date> _takenIn;             // the tree, as it was at that date
+    std::set<UserName> _leftAlone;            // other trees, until their owners have mended them; as _takesIn
+    CXDChangeRecords _leftovers;              // of the gathering that is under way
+    std::set<UniqueId> _foundAgain;           // contacts that the next look takes away, too; of this gathering
+    std::map<UserName, Dictionary> _read;     // so far: the states of known users
+    std::map<UserName, Comparison> _moments;  // the last comparisons that found nothing but contacts
+    std::map<UserName, Comparison> _compared; // those that the gathering under way has not made again
+    std::map<UserName, Comparison> _lookedAt; // and what it has seen of these trees
+    bool _gathering = false;                  // `open` belongs to a gathering
     Mutex _structureLock;
     std::future<void> _structure GUARDED_BY(_structureLock); // the look at the own tree that is under way
     // The account is the manager's for good, and every record asks for its user's base location several times.

@@ -108,14 +108,14 @@ std::optional<CXDVaultraConduit::Comparison> CXDVaultraConduit::comparisonWith(c
         (user == kSelf && (isBeingMended() || !engine().conduitObjectForKey(kConduitCX, kPublishAgain).empty())))
         return std::nullopt;
     const auto tree = _with.manager.markOfTree(base, ask);
-    return tree ? std::optional(Comparison{_with.rolvane.journalPosition(), *states, *tree}) : std::nullopt;
+    return tree ? std::optional(Comparison{_with.rolvane.journalPosition(), *states, *tree, {}}) : std::nullopt;
 }
 
 std::optional<Dictionary> CXDVaultraConduit::contactsChangedAlone(const UserName& user, const Url& base) {
-    const auto before = _foundNothing.find(user);
+    const auto before = _moments.find(user);
     const Dictionary users = engine().conduitObjectForKey(kConduitVaultra, kPriorState);
     const Dictionary* known = users[user.str()].dictionaryIf();
-    if (before == _foundNothing.end() || !known || known->contains(kAllIsNew) || _leftAlone.contains(user))
+    if (before == _moments.end() || !known || known->contains(kAllIsNew) || _leftAlone.contains(user))
         return std::nullopt;
     if (user == kSelf && (_takesIn || (_isOneOfSeveral && isToTellAgain((*known)[kSerialNumber])))) return std::nullopt;
     const auto now = comparisonWith(user, base, true);
@@ -140,7 +140,9 @@ std::optional<Dictionary> CXDVaultraConduit::contactsChangedAlone(const UserName
 // Contacts that the database does not have are a matter of the lists that name them.
 std::optional<Dictionary> CXDVaultraConduit::contactsChangedSince(const UserName& user, const Url& base,
                                                                   const Comparison& before) {
-    const auto files = _with.manager.contactsChangedSince(base, before.tree);
+    std::vector<Url> found;
+    for (const UniqueId& contact : before.found) found.push_back(layout::contactLocation(base, contact));
+    const auto files = _with.manager.contactsChangedSince(base, before.tree, found);
     if (!files) return std::nullopt;
     Dictionary contacts;
     for (const auto& [path, file] : *files) {
@@ -153,17 +155,25 @@ std::optional<Dictionary> CXDVaultraConduit::contactsChangedSince(const UserName
     return contacts;
 }
 
-// `journal`: as it was when the trees were read; `changed`: for whom there is anything to be done.
-void CXDVaultraConduit::noteWithoutChanges(int64_t journal, const std::set<UserName>& changed) {
-    for (const auto& [user, state] : _read)
-        if (!changed.contains(user))
-            if (const auto base = baseLocationForUser(realUserFromUser(user)))
-                if (const auto compared = comparisonWith(user, *base, false))
-                    _compared.emplace(user, Comparison{journal, compared->states, compared->tree});
+// `journal`: as it was when the trees were read.
+void CXDVaultraConduit::noteCompared(int64_t journal, const std::map<UserName, Found>& found) {
+    constexpr size_t kFew = 100;
+    const Found nothing;
+    for (const auto& [user, state] : _read) {
+        const auto in = found.find(user);
+        const Found& here = in == found.end() ? nothing : in->second;
+        // The next look begins here, and looks at the contacts that were found once more. Other changes leave no
+        // such moment: a pass that takes them in has other states behind it.
+        const bool mayBeBegunFrom = here.isContactsAlone && here.contacts.size() <= (user == kSelf ? 0 : kFew);
+        if (!mayBeBegunFrom) continue;
+        if (const auto base = baseLocationForUser(realUserFromUser(user)))
+            if (const auto compared = comparisonWith(user, *base, false))
+                _compared.emplace(user, Comparison{journal, compared->states, compared->tree, here.contacts});
+    }
     // Where a contact was found, the next look begins at the same moment, and finds whether it was taken in.
     for (auto& [user, now] : std::exchange(_lookedAt, {}))
-        if (!changed.contains(user)) _compared.insert_or_assign(user, Comparison{journal, now.states, now.tree});
-    _foundNothing = std::exchange(_compared, {});
+        if (!found.contains(user)) _compared.insert_or_assign(user, Comparison{journal, now.states, now.tree, {}});
+    _moments = std::exchange(_compared, {});
 }
 
 // Single files that are too many or too few: another writer has deleted what somebody else was about to write, or the
@@ -264,18 +274,26 @@ CXDChangeRecords CXDVaultraConduit::changeRecords() {
     if (_with.rolvane.allGroup()->valueForProperty(kCXRemoteLocationProperty) && endedPublication(_with.preferences))
         _with.preferences.remove(kDaemonDomain, kCXDEndedPublication); // published again since
     readPublishAgain();
-    std::set<UserName> changed;
-    for (const CXDChangeRecordPtr& record : records)
-        if (record->user()) changed.insert(*record->user());
+    std::map<UserName, Found> found;
+    const auto note = [&](const CXDChangeRecords& some) {
+        for (const CXDChangeRecordPtr& record : some) {
+            if (!record->user()) continue;
+            Found& here = found[*record->user()];
+            if (record->type() == CXDUpdateRecord && record->person())
+                here.contacts.insert(cxNormalizedUID(*record->person()));
+            else
+                here.isContactsAlone = false;
+        }
+    };
+    note(records);
     leaveUnlistedOut(records);
     forgetWhatHasAFile();
     nameAgain(records);
     compareUnlistedGroups(records);
     compareWhatHadCome(records);
-    for (const CXDChangeRecords* some : {&records, &_leftovers})
-        for (const CXDChangeRecordPtr& record : *some)
-            if (record->user()) changed.insert(*record->user());
-    noteWithoutChanges(journal, changed);
+    note(records);
+    note(_leftovers);
+    noteCompared(journal, found);
     if (const auto own = _read.find(kSelf); _takesIn && own != _read.end())
         _takenIn =
             own->second[kTreeDates].dictionary()[std::string(layout::kDateFile)].date().value_or(Date::distantPast());

@@ -351,7 +351,8 @@ std::optional<CXDAVManager::TreeMark> CXDAVManager::markOfTree(const Url& tree, 
     return listing == 0 ? std::nullopt : std::optional(TreeMark{listing, _impl->versions.changes()});
 }
 
-std::optional<FileListing> CXDAVManager::contactsChangedSince(const Url& tree, const TreeMark& mark) {
+std::optional<FileListing> CXDAVManager::contactsChangedSince(const Url& tree, const TreeMark& mark,
+                                                              const std::vector<Url>& others) {
     StoreListing::AskedRef asked;
     {
         const Lock guard(_impl->begunLock);
@@ -359,7 +360,7 @@ std::optional<FileListing> CXDAVManager::contactsChangedSince(const Url& tree, c
         if (found != _impl->begunListings.end()) asked = found->second;
     }
     return StoreListing(_impl->session, _impl->versions, _impl->listings())
-        .contactsChangedSince(tree, asked, mark.listing, mark.versions);
+        .contactsChangedSince(tree, asked, {mark.listing, mark.versions, others});
 }
 
 std::map<std::string, Date> CXDAVManager::datesOfTree(const Url& tree) {

@@ -154,8 +154,10 @@ public:
     // where the store does not tell, or the tree was not listed yet.
     std::optional<TreeMark> markOfTree(const Url& tree, bool ask);
     // The contact files that would stand differently in a listing than in one at that mark, after the store was
-    // asked for the present mark. Nothing where anything else of the tree may be different, too.
-    std::optional<FileListing> contactsChangedSince(const Url& tree, const TreeMark& mark);
+    // asked for the present mark; and `others`. Nothing where one of them is not there, or where anything else of
+    // the tree may be different, too.
+    std::optional<FileListing> contactsChangedSince(const Url& tree, const TreeMark& mark,
+                                                    const std::vector<Url>& others);
     // The dates of the tree's own files ("info", "dateFile"), as of the last listing.
     std::map<std::string, Date> datesOfTree(const Url& tree);
     // This client has found it whole, or made it, and nothing has spoken against it since.

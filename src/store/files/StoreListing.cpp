@@ -315,14 +315,15 @@ bool StoreListing::bringUpToDate(const Url& tree, AskedRef& begun) {
     return false;
 }
 
-std::optional<FileListing> StoreListing::contactsChangedSince(const Url& tree, const AskedRef& begun, uint64_t listing,
-                                                              uint64_t versions) {
-    const auto files = _listings.filesChangedSince(tree, listing);
-    const auto known = _versions.changedSince(versions);
+std::optional<FileListing> StoreListing::contactsChangedSince(const Url& tree, const AskedRef& begun,
+                                                              const Since& since) {
+    const auto files = _listings.filesChangedSince(tree, since.listing);
+    const auto known = _versions.changedSince(since.versions);
     if (!files || !known) return std::nullopt;
     std::set<std::string> names(files->begin(), files->end());
     for (const std::string& url : *known)
         if (url.starts_with(tree.absoluteString() + "/")) names.insert(url);
+    for (const Url& other : since.others) names.insert(other.absoluteString());
     FileListing out;
     const Url people = tree.cxURLByAppendingComponent("People");
     for (const std::string& name : names) {

@@ -39,10 +39,12 @@ public:
     std::optional<FileListing> list(const Url& container, const AskedRef& begun = {},
                                     const CXFileManager::ListingPart& part = {});
     // Of a tree that was brought up to date, the entries of contact files that may be different from those of a listing
-    // at an earlier moment: in that state of the memory of listings, with so many changes of known versions. Nothing
-    // where anything else may be different, too.
-    std::optional<FileListing> contactsChangedSince(const Url& tree, const AskedRef& begun, uint64_t listing,
-                                                    uint64_t versions);
+    // at an earlier moment, and of others. Nothing where anything else may be different, too.
+    struct Since {
+        uint64_t listing, versions;     // state of the memory of listings, count of changes of known versions
+        const std::vector<Url>& others; // contacts whose entries are given in any case
+    };
+    std::optional<FileListing> contactsChangedSince(const Url& tree, const AskedRef& begun, const Since& since);
     // The names of the direct members of each container, with what they are. Nothing for a container that cannot be
     // listed; `codes` tells why.
     struct Members {
