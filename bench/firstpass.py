@@ -208,17 +208,17 @@ class Tree:
 class Subscription:
     """The part "subscription" of the benchmarks."""
 
-    SIZES, QUICK_SIZES = (1000, 10000, 50000), (1000, 10000)
     FAR = {1000: "h1", 10000: "h2"}
 
-    def __init__(self, bench, quick):
-        self.bench, self.quick, self.store = bench, quick, bench.store
+    def __init__(self, bench, quick, sizes):
+        self.bench, self.quick, self.sizes, self.store = bench, quick, sizes, bench.store
         self.made, self.names = 0, []
         self.results = {"first": [], "nothing": []}
 
     def run(self):
-        sizes = self.QUICK_SIZES if self.quick else self.SIZES
-        for count in sizes:
+        for count in self.sizes:
+            if self.bench.is_late(f"subscription of {count}"):
+                continue
             publisher = self.bench.publisher(count, 10)
             publisher.publish()
             self.invite(publisher, 2 * self.rounds(count) + (2 if count in self.FAR else 0))
@@ -253,6 +253,8 @@ class Subscription:
     def near(self, tree):
         self.heading(f"{tree.count} people, loopback")
         for protocol in ("h1", "h2"):
+            if self.bench.is_late(f"subscription of {tree.count}, {protocol}"):
+                continue
             row = {"people": tree.count, "protocol": protocol, "round_trip_ms": 0}
             others = ("raw", "curl", "rclone") if tree.count == 1000 and protocol == "h1" else ("raw", "curl")
             for i in range(self.rounds(tree.count)):
@@ -268,6 +270,8 @@ class Subscription:
 
     def far(self, tree, protocol):
         for milliseconds in (20, 100):
+            if self.bench.is_late(f"subscription of {tree.count} behind {milliseconds} ms"):
+                continue
             self.heading(f"{tree.count} people, {milliseconds} ms")
             row = {"people": tree.count, "protocol": protocol, "round_trip_ms": milliseconds}
             with Delay(self.bench.build, self.store.port, milliseconds) as delay:
