@@ -16,7 +16,7 @@ import tempfile
 import time
 
 sys.path.insert(0, os.path.dirname(os.path.abspath(__file__)))
-from benchworld import write_cards  # noqa: E402
+from benchworld import wait_until, write_cards  # noqa: E402
 
 BUILD = os.path.abspath(sys.argv[1])
 PEOPLE = int(sys.argv[2]) if len(sys.argv) > 2 else 100000
@@ -61,8 +61,12 @@ def free_port():
 
 class Worker:
     def __init__(self, parent):
-        with open(f"/proc/{parent}/task/{parent}/children") as file:
-            self.pid = int(file.read().split()[0])
+        def children():
+            with open(f"/proc/{parent}/task/{parent}/children") as file:
+                return file.read().split()
+
+        wait_until(lambda: (children(), "no worker"), 20, "httpd has no worker")
+        self.pid = int(children()[0])
 
     def cpu(self):
         with open(f"/proc/{self.pid}/stat") as file:

@@ -76,7 +76,7 @@ def measure(publisher, subscriber, store, count):
     alice, bob = Watched(publisher, store), Watched(subscriber, store)
     for person in (publisher, subscriber):
         person.run("daemon", "start")
-    names = [f"Fräulein Numéro {7 + 11 * i % count}" for i in range(30)]
+    names = [f"Fräulein Numéro {(7 + 11 * i) % count}" for i in range(30)]
     publisher.run("sync")
     subscriber.run("sync")
     found = {}
