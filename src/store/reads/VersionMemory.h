@@ -53,8 +53,8 @@ public:
     // none, or no tag tells the version.
     uint64_t markOf(std::string_view url);
 
-    // Forgets everything, unless it was saved for this database, in this state or an earlier one. So does the file, even
-    // where nothing is asked and saved afterwards, as in a pass that does not reach the store.
+    // Forgets everything, unless it was saved for this database, in this state or an earlier one. So does the file,
+    // even where nothing is asked and saved afterwards, as in a pass that does not reach the store.
     void belongTo(const Owner& owner);
     void save(const Owner& owner); // nothing when unchanged; a failure is logged
     void revert();                 // to what was saved last
