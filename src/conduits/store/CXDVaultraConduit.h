@@ -138,7 +138,7 @@ private:
         CXDAVManager::TreeMark tree;
         std::set<UniqueId> found; // contacts that were to be read then, as the tree names them
     };
-    // What the gathering under way has found in a tree.
+    // Changes of one tree that the gathering under way has found.
     struct Found {
         bool isContactsAlone = true;
         std::set<UniqueId> contacts;
