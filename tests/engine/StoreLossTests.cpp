@@ -352,6 +352,51 @@ TEST_F(StoreLoss, AGroupsLostListTakesNoMemberAlongAndIsWrittenAgain) {
     expectMended(before);
 }
 
+// Of all that was published the group alone is written again.
+TEST_F(StoreLoss, ALostGroupThatIsWrittenAgainBringsNobodyBackWhoWasDeletedMeanwhile) {
+    settle();
+    bob.application->removeRecord(bob.copyOf(people[0]));
+    bob.application->save();
+    bob.pass();
+    std::filesystem::remove_all(tree() / friends->uniqueId().str());
+    for (int i = 0; i < 3; ++i) alice.pass();
+    EXPECT_TRUE(log.mentions("has lost a group that it still names")) << log.text();
+    EXPECT_TRUE(std::filesystem::exists(tree() / friends->uniqueId().str())) << log.text();
+    settle();
+    EXPECT_EQ(alice.countPeople(), 2u) << log.text();
+    EXPECT_EQ(friends->members().size(), 1u) << log.text();
+    EXPECT_EQ(copies(), alice.view()) << log.text();
+    EXPECT_FALSE(std::filesystem::exists(fileOf(people[0])));
+}
+
+// A killed daemon's lock keeps the writer from the list for a while, so the owner takes the group for lost.
+TEST_F(StoreLoss, ADeletionOfAGroupThatIsCutOffGoesOnAndTakesNothingBack) {
+    settle();
+    bob.application->removeRecord(bob.copyOf(people[0]));
+    bob.application->save();
+    bob.pass();
+    bob.application->removeRecord(
+        bob.application->recordForUniqueId(cxUIDWithTableName(friends->uniqueId(), kCXSubscribedGroupTable)));
+    bob.application->save();
+    bool isRefused = true;
+    bob.wire->intercept([&](const HttpRequest& request) -> std::optional<HttpResponse> {
+        if (!isRefused || request.method != "LOCK") return std::nullopt;
+        HttpResponse response;
+        response.status = 423;
+        return response;
+    });
+    bob.pass();
+    ASSERT_FALSE(bob.engine->getPendingChanges().empty()) << bob.wire->text();
+    ASSERT_FALSE(std::filesystem::exists(tree() / friends->uniqueId().str())) << bob.wire->text();
+    for (int i = 0; i < 4; ++i) alice.pass();
+    isRefused = false;
+    for (int i = 0; i < 2; ++i) settle();
+    EXPECT_TRUE(alice.application->listGroups(RemoteLocation()).empty()) << log.text();
+    EXPECT_EQ(alice.countPeople(), 2u) << log.text();
+    EXPECT_EQ(copies(), alice.view()) << log.text();
+    EXPECT_TRUE(bob.engine->getPendingChanges().empty());
+}
+
 TEST_F(StoreLoss, AGroupThatAWriterDeletesIsNotTakenForALoss) {
     settle();
     bob.application->removeRecord(

@@ -151,6 +151,7 @@ private:
     void awaitStructure();                            // any thread
     bool isHeld(const CXDChangeRecord& record) const; // any thread
     void publishAgain(const TreeCondition& condition, const Dictionary& state);
+    void writeAgain(const std::vector<UniqueId>& groups, Dictionary prior);
     void readPublishAgain();
     void restoreAccessLists();
     bool isBeingMended();

@@ -75,18 +75,22 @@ bool CXDVaultraConduit::isTrusted(const UserName& user, const Dictionary& state)
         return true;
     }
     CXLog("The tree of %@ %@. %@", isOwn ? *realUserFromUser(user) : user, condition.sentence,
-          isOwn ? "It is published again." : "It is left alone until its owner has mended it.");
+          isOwn ? condition.kind == TreeCondition::Kind::lostAGroup ? "That alone is written again."
+                                                                    : "It is published again."
+                : "It is left alone until its owner has mended it.");
     if (condition.kind == TreeCondition::Kind::setBack) prior.set(kTreeDates, datesToWaitFor(state));
     if (!isOwn) {
         _leftAlone.insert(user);
         return false;
     }
-    const bool isRefused = !engine().conduitObjectForKey(kConduitCX, kRefusedByStore).empty();
-    const bool mayNeverHaveBeenThere =
-        condition.kind == TreeCondition::Kind::lostAGroup || condition.kind == TreeCondition::Kind::lostContacts;
-    if (mayNeverHaveBeenThere && isRefused) return false; // it could not be written yet
+    const bool isGroup = condition.kind == TreeCondition::Kind::lostAGroup;
+    const bool mayNeverHaveBeenThere = isGroup || condition.kind == TreeCondition::Kind::lostContacts;
+    // It could not be written yet, or waits for a lock.
+    if (mayNeverHaveBeenThere && engine().hasPendingChanges(kSelf, conduitSource())) return false;
     if (condition.mayPass() && !looked)
         prior.set(kLookAgain, true);
+    else if (isGroup)
+        writeAgain(groupsThatAreLost(prior, state, isHere), prior);
     else
         publishAgain(condition, state);
     engine().bringSourcesUpToDate(); // after this pass
@@ -506,6 +510,18 @@ void CXDVaultraConduit::publishAgain(const TreeCondition& condition, const Dicti
     if (_isOneOfSeveral && !state[std::string(layout::kAllGroup)].dictionary()[kMemberUIDState].isArray())
         again.set(kLostList, listOfAllThatLiesThere(state));
     restoreAccessLists();
+}
+
+// The next scan takes these groups for new, and nothing else. A writer who is cut off while deleting a group leaves
+// such a tree, too: that group goes again with its name, and nobody whom others have deleted comes back with it.
+void CXDVaultraConduit::writeAgain(const std::vector<UniqueId>& groups, Dictionary prior) {
+    Dictionary own = engine().conduitObjectForKey(kConduitCX, kPriorState).dictionaryFor(kSelf.str());
+    Dictionary unsettled = engine().conduitObjectForKey(kConduitCX, kUnsettledGroups);
+    for (const UniqueId& group : groups) {
+        prior.remove(group.str());
+        own.remove(group.str());
+        unsettled.set(cxUIDWithTableName(group, kCXGroupTable).str(), true);
+    }
 }
 
 void CXDVaultraConduit::readPublishAgain() {

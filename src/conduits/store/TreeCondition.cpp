@@ -51,16 +51,6 @@ std::unordered_set<std::string> groupsThatAreListed(const Dictionary& prior, con
     return listed;
 }
 
-bool hasLostAGroup(const Dictionary& prior, const Dictionary& current, const IsHere& isHere) {
-    std::vector<std::string> missing;
-    for (const auto& [name, group] : prior)
-        if (isGroup(name) && name != kEverybody && !group.dictionary().empty() && current[name].dictionary().empty())
-            if (isOrMayBeHere(isHere, Value(name))) missing.push_back(name);
-    if (missing.empty()) return false;
-    const auto listed = groupsThatAreListed(prior, current);
-    return std::any_of(missing.begin(), missing.end(), [&](const auto& name) { return listed.contains(name); });
-}
-
 bool isSetBack(const Dictionary& prior, const Dictionary& current, const std::optional<Date>& lastVisit) {
     const auto visited = dateIn(current, kClockFile);
     for (const auto& before : {dateIn(prior, kClockFile), lastVisit})
@@ -117,12 +107,24 @@ TreeCondition treeCondition(const Dictionary& prior, const Dictionary& current, 
         return {Kind::lostLists, "has lost the list of its contacts"};
     if (listed && isListReplaced(prior[kEverybody].dictionary()[kMemberUIDState].array(), *listed, people, isHere))
         return {Kind::replacedList, "has another list, which names nobody of those who lie there"};
-    if (hasLostAGroup(prior, current, isHere)) return {Kind::lostAGroup, "has lost a group that it still names"};
+    if (!groupsThatAreLost(prior, current, isHere).empty())
+        return {Kind::lostAGroup, "has lost a group that it still names"};
     // A writer takes a contact's file away before the name. Its owner writes what is missing, file by file.
     const bool misses = !listed || std::any_of(listed->begin(), listed->end(),
                                                [&](const Value& name) { return isOrMayBeHere(isHere, name); });
     if (!hasContacts && misses && !lastVisit) return {Kind::lostContacts, "has lost the contents of its contacts"};
     return {};
+}
+
+std::vector<UniqueId> groupsThatAreLost(const Dictionary& prior, const Dictionary& current, const IsHere& isHere) {
+    std::vector<UniqueId> missing;
+    for (const auto& [name, group] : prior)
+        if (isGroup(name) && name != kEverybody && !group.dictionary().empty() && current[name].dictionary().empty())
+            if (isOrMayBeHere(isHere, Value(name))) missing.emplace_back(name);
+    if (missing.empty()) return missing;
+    const auto listed = groupsThatAreListed(prior, current);
+    std::erase_if(missing, [&](const UniqueId& name) { return !listed.contains(name.str()); });
+    return missing;
 }
 
 Dictionary datesToWaitFor(const Dictionary& current) {

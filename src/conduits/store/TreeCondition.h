@@ -57,6 +57,9 @@ struct TreeCondition {
 TreeCondition treeCondition(const Dictionary& prior, const Dictionary& current, std::optional<Date> lastVisit,
                             const IsHere& isHere = {});
 
+// The groups that make a tree one that has lost a group.
+std::vector<UniqueId> groupsThatAreLost(const Dictionary& prior, const Dictionary& current, const IsHere& isHere = {});
+
 // Nobody but the owner can mend a tree that was set back. What to remember as its dates, so that it counts as set back
 // until its owner has been there again.
 Dictionary datesToWaitFor(const Dictionary& current);
