@@ -3,6 +3,7 @@
 #include "../apps/FaultyStore.h"
 
 #include <array>
+#include <optional>
 
 namespace rolvane::board {
 
@@ -95,6 +96,16 @@ private:
     std::string _met;
 };
 
+// A pass with each write from this one on spoiled; none when it makes fewer.
+std::optional<Ending> passWithoutWrites(Stage& stage, char role, size_t write, const std::string& kind) {
+    const Spoiled spoiled(stage.entrance(), write, kind, Spoils::writes, kMostRequests);
+    const Ending ending = stage.pass(role);
+    const std::string met = spoiled.met();
+    if (met.empty()) return std::nullopt;
+    stage.tell("   FAULT " + kind + " from " + met + " on");
+    return ending;
+}
+
 } // namespace
 
 bool spoilRequest(Work& work, const Scenario& scenario, size_t request, const std::string& kind, Spoils spoils) {
@@ -124,20 +135,13 @@ bool spoilWrites(Work& work, const Scenario& scenario, size_t write, const std::
     Stage& stage = work.stage;
     stage.forgetStory();
     stage.bringBack(scenario.name);
-    Ending ending;
-    std::string met;
-    {
-        const Spoiled spoiled(stage.entrance(), write, kind, Spoils::writes, kMostRequests);
-        ending = stage.pass(scenario.role);
-        met = spoiled.met();
-    }
-    if (met.empty()) return false;
-    stage.tell("   FAULT " + kind + " from " + met + " on");
+    const std::optional<Ending> ending = passWithoutWrites(stage, scenario.role, write, kind);
+    if (!ending) return false;
     if (kind == "403" && scenario.role == 'w') stage.model().refused('w');
     goOn(work, scenario, write);
     Settling settling = settlingOf(scenario);
     settling.later = kAnHour;
-    judge(work, scenario.name + ", " + kind + " from write " + std::to_string(write) + " on", settling, ending);
+    judge(work, scenario.name + ", " + kind + " from write " + std::to_string(write) + " on", settling, *ending);
     return true;
 }
 
@@ -149,19 +153,12 @@ bool spoilNewOnes(Work& work, const Scenario& scenario, size_t write, const std:
     stage.bringBack(scenario.name);
     const auto makes = [](worlds::Editor& editor) { editor.makePeople(kNewOnes); };
     stage.edit(scenario.role, makes, stamp);
-    Ending ending;
-    std::string met;
-    {
-        const Spoiled spoiled(stage.entrance(), write, kind, Spoils::writes, kMostRequests);
-        ending = stage.pass(scenario.role);
-        met = spoiled.met();
-    }
-    if (met.empty()) return false;
-    stage.tell("   FAULT " + kind + " from " + met + " on");
+    const std::optional<Ending> ending = passWithoutWrites(stage, scenario.role, write, kind);
+    if (!ending) return false;
     const auto takesBack = [&](worlds::Editor& editor) { editor.takeBack(stamp); };
     stage.edit(scenario.role, takesBack, "back");
     judge(work, scenario.name + " with new contacts, " + kind + " from write " + std::to_string(write) + " on",
-          settlingOf(scenario), ending);
+          settlingOf(scenario), *ending);
     return true;
 }
 

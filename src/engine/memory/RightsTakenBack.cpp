@@ -1,6 +1,7 @@
 #include "engine/memory/RightsTakenBack.h"
 
 #include "contacts/records/Constants.h"
+#include "contacts/records/Identifier.h"
 #include "engine/memory/EngineState.h"
 #include "engine/memory/PriorStates.h"
 #include "model/PayloadKeys.h"
@@ -15,8 +16,8 @@ void forgetRightTakenBack(Preferences& preferences, const std::string& user, boo
         for (const CXDChangeType list : {CXDChangeGroupReadWriteACL, CXDChangeGroupReadACL}) {
             if (list == CXDChangeGroupReadACL && !reading) continue;
             updateCache(data, CXDSyncSourceCX,
-                        CXDChangeRecord(CXDSyncSourceCX, list, kSelf, std::nullopt, UniqueId("AllCXGroup"),
-                                        Dictionary{{kDeletions, Array{user}}}));
+                        CXDChangeRecord(CXDSyncSourceCX, list, kSelf, std::nullopt,
+                                        UniqueId(std::string(kCXAllGroupUID)), Dictionary{{kDeletions, Array{user}}}));
         }
     });
     state.syncPrefs();
