@@ -32,6 +32,13 @@ protected:
         ASSERT_FALSE(text.empty()) << file;
         rewrite(file, text + " ");
     }
+    // The store gives Bob none, until the interception is taken away.
+    void refuseContacts() {
+        bob.wire->intercept([](const HttpRequest& request) -> std::optional<HttpResponse> {
+            const bool isContact = request.method == "GET" && request.url.path().find("People") != std::string::npos;
+            return isContact ? std::optional(answerOf(503)) : std::nullopt;
+        });
+    }
 };
 
 TEST_F(UnchangedTrees, APassAsksFiveTimesAtMost) {
@@ -95,10 +102,7 @@ TEST_F(UnchangedTrees, AnEditThatCameWithAGroupAndCouldNotBeReadComesLater) {
     settle();
     touchAGroup();
     writeElsewhere(people[1], "Benjamin");
-    bob.wire->intercept([](const HttpRequest& request) -> std::optional<HttpResponse> {
-        const bool isContact = request.method == "GET" && request.url.path().find("People") != std::string::npos;
-        return isContact ? std::optional(answerOf(503)) : std::nullopt;
-    });
+    refuseContacts();
     bob.pass();
     EXPECT_NE(firstName(bob.copyOf(people[1])), Value("Benjamin"));
     bob.wire->intercept({});
@@ -147,11 +151,7 @@ TEST_F(UnchangedTrees, ShortLooksFindAllThatAComparisonOfEverybodyFinds) {
         }
         alice.pass();
         if (upTo(4) == 0) { // a pass that cannot read contacts
-            bob.wire->intercept([](const HttpRequest& request) -> std::optional<HttpResponse> {
-                const bool isContact =
-                    request.method == "GET" && request.url.path().find("People") != std::string::npos;
-                return isContact ? std::optional(answerOf(503)) : std::nullopt;
-            });
+            refuseContacts();
             bob.pass();
             bob.wire->intercept({});
         }
@@ -176,10 +176,7 @@ TEST_F(UnchangedTrees, ShortLooksFindAllThatAComparisonOfEverybodyFinds) {
 TEST_F(UnchangedTrees, AnEditThatCouldNotBeReadComesLater) {
     settle();
     writeElsewhere(people[1], "Benjamin");
-    bob.wire->intercept([](const HttpRequest& request) -> std::optional<HttpResponse> {
-        const bool isContact = request.method == "GET" && request.url.path().find("People") != std::string::npos;
-        return isContact ? std::optional(answerOf(503)) : std::nullopt;
-    });
+    refuseContacts();
     bob.pass();
     EXPECT_NE(firstName(bob.copyOf(people[1])), Value("Benjamin"));
     writeElsewhere(people[2], "Cleopatra");
