@@ -410,8 +410,8 @@ TEST_F(TwoComputers, AWithdrawalOnOneIsNotUndoneByTheOther) {
     EXPECT_NE(laptop.alert.told[0].message.find("another computer"), std::string::npos);
 }
 
-// The tree is published again, in several passes: neither computer may wait for the other one meanwhile.
-TEST_F(TwoComputers, ATreeThatIsPublishedAgainGetsWhatTheFirstPassOfThatLeft) {
+// The group is written again, in several passes: neither computer may wait for the other one meanwhile.
+TEST_F(TwoComputers, ALostGroupIsWrittenAgainThoughTheFirstPassesOfThatFailed) {
     joinAndSettle();
     ASSERT_GT(std::filesystem::remove_all(world->file(friends->uniqueId().str())), 0u);
     const auto fails = std::make_shared<std::atomic<bool>>(true);
@@ -421,7 +421,7 @@ TEST_F(TwoComputers, ATreeThatIsPublishedAgainGetsWhatTheFirstPassOfThatLeft) {
             return *fails && request.method == "PUT" && isOfAGroup ? std::optional(answerOf(503)) : std::nullopt;
         });
     settle();
-    EXPECT_NE(log.text().find("It is published again"), std::string::npos) << log.text();
+    EXPECT_NE(log.text().find("That alone is written again"), std::string::npos) << log.text();
     *fails = false;
     name(laptop, people[0], "Adelheid");
     name(desk, people[1], "Benjamin");
